@@ -1,0 +1,77 @@
+// EntryStream: the entries of a trace store, one after another, their fields as small integers.
+//
+// A store keeps each distinct FIELD=value once and an entry refers to it. So the reader shows each
+// distinct value once to a FieldTokenizer, which parses and interns it and answers with a token;
+// an entry then is a header and a list of tokens. Fields of no interest have token 0 and are left
+// out of the list.
+//
+// Threads: one at a time, but for StopFlag.
+
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstdint>
+#include <span>
+#include <string_view>
+
+namespace tessel {
+
+using FieldToken = uint32_t;
+inline constexpr FieldToken kNoToken = 0;
+
+using Id128 = std::array<uint8_t, 16>;
+
+// Longest name of a field and longest value that a tokenizer is shown in full.
+inline constexpr size_t kMaxFieldNameLength = 64;
+inline constexpr size_t kMaxFieldValueLength = 4096;
+inline constexpr size_t kMaxFieldHead = kMaxFieldNameLength + 1 + kMaxFieldValueLength + 1;
+
+// Turns distinct FIELD=value texts into tokens.
+class FieldTokenizer {
+ public:
+  virtual ~FieldTokenizer() = default;
+  // Whether a field of this name can ever have a token; asked before a value is decompressed.
+  virtual bool wants(std::string_view fieldName) const = 0;
+  // The token of one FIELD=value. `head` is its beginning, up to kMaxFieldHead bytes; `size` its
+  // whole length in bytes. The same text may be shown more than once.
+  virtual FieldToken tokenFor(std::string_view head, uint64_t size) = 0;
+  // Changes when all tokens handed out so far become void (the tokenizer was emptied to stay within
+  // its memory); a reader then drops what it remembers and asks again. Changes only inside
+  // beginEntry().
+  virtual uint32_t generation() const = 0;
+  // Called by the innermost reader before it collects the tokens of an entry: from here until the
+  // entry was consumed no token becomes void.
+  virtual void beginEntry() = 0;
+};
+
+// Where an entry stands in time and in the journal's own order.
+struct EntryHeader {
+  Id128 sequenceId{};     // which sequence `sequenceNumber` counts in; all zero: unknown
+  uint64_t sequenceNumber = 0;
+  Id128 bootId{};
+  uint64_t monotonic = 0;  // microseconds since boot
+  uint64_t realtime = 0;   // microseconds since 1970, UTC
+  uint64_t contentHash = 0;  // exclusive or of the hashes of its data; 0: unknown
+};
+
+struct Entry {
+  EntryHeader header;
+  std::span<const FieldToken> tokens;  // valid until the next call of next()
+};
+
+// Set from any thread; readers look at it often enough to end within a few milliseconds.
+using StopFlag = std::atomic<bool>;
+
+class EntryStream {
+ public:
+  virtual ~EntryStream() = default;
+  // Moves to the next entry; false at the end, or soon after the stop flag was set.
+  virtual bool next() = 0;
+  // REQUIRES: the last next() answered true. Peeking at the header costs nothing; the tokens are
+  // collected by entry().
+  virtual const EntryHeader& header() const = 0;
+  virtual Entry entry() = 0;
+};
+
+}  // namespace tessel

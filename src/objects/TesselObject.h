@@ -1,0 +1,170 @@
+// The trace objects: what the extraction service delivers, one class per kind.
+//
+//   TesselSupportObject -> TesselObject -> TesselEvent
+//                                       -> TesselInterval -> TesselAnimationInterval
+//
+// Objects are immutable after delivery and shared by reference count; any thread may read them.
+// Their strings are borrowed from the string pool of the extraction, which each object keeps
+// alive. A string property may be absent.
+//
+// The last three operations of each class are what the service adds to it for reporting; a class
+// that does not define one inherits that of the class it is derived from.
+
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/Number.h"
+#include "platform/Payload.h"
+#include "platform/SharedString.h"
+
+namespace tessel {
+
+class ProcessIdentity;
+
+// The most derived class of this tree that an object belongs to.
+enum class TesselClass { supportObject, object, event, interval, animationInterval };
+
+class TesselSupportObject {
+ public:
+  TesselSupportObject() = default;
+  TesselSupportObject(const TesselSupportObject&) = delete;
+  TesselSupportObject& operator=(const TesselSupportObject&) = delete;
+  virtual ~TesselSupportObject() = default;
+
+  // Membership by derivation: an animation interval is also an interval and an object.
+  bool isKindOf(TesselClass wanted) const;
+
+  virtual bool canGenerateStatoraPayload() const { return false; }
+  // The analytics payload, or nothing for a class that has none.
+  virtual std::optional<Payload> statoraPayload(ProcessIdentity& identity) const;
+
+ protected:
+  explicit TesselSupportObject(TesselClass tesselClass) : class_(tesselClass) {}
+
+ private:
+  const TesselClass class_ = TesselClass::supportObject;
+};
+
+// What every trace point carries. Strings are borrowed from `strings`.
+struct TracePointFields {
+  std::shared_ptr<const StringPool> strings;
+  StringRef subsystem;
+  StringRef category;
+  StringRef name;
+  StringRef string1Name;
+  StringRef string1Value;
+  StringRef string2Name;
+  StringRef string2Value;
+  StringRef number1Name;
+  std::optional<Number> number1Value;
+  StringRef number2Name;
+  std::optional<Number> number2Value;
+  float durationSeconds = 0;  // seconds
+  bool telemetryEnabled = false;
+};
+
+class TesselObject : public TesselSupportObject {
+ public:
+  explicit TesselObject(TracePointFields fields) : TesselObject(TesselClass::object, std::move(fields)) {}
+
+  StringRef subsystem() const { return fields_.subsystem; }
+  StringRef category() const { return fields_.category; }
+  StringRef name() const { return fields_.name; }
+  StringRef string1Name() const { return fields_.string1Name; }
+  StringRef string1Value() const { return fields_.string1Value; }
+  StringRef string2Name() const { return fields_.string2Name; }
+  StringRef string2Value() const { return fields_.string2Value; }
+  StringRef number1Name() const { return fields_.number1Name; }
+  const std::optional<Number>& number1Value() const { return fields_.number1Value; }
+  StringRef number2Name() const { return fields_.number2Name; }
+  const std::optional<Number>& number2Value() const { return fields_.number2Value; }
+  float durationSeconds() const { return fields_.durationSeconds; }
+  bool telemetryEnabled() const { return fields_.telemetryEnabled; }
+
+  // "TesselObject", "Event", "Interval" or "AnimationInterval".
+  virtual std::string_view tesselType() const { return "TesselObject"; }
+  std::optional<Payload> statoraPayload(ProcessIdentity& identity) const override;
+
+ protected:
+  TesselObject(TesselClass tesselClass, TracePointFields fields)
+      : TesselSupportObject(tesselClass), fields_(std::move(fields)) {}
+
+ private:
+  const TracePointFields fields_;
+};
+
+// The process that emitted an event.
+struct EmittingProcess {
+  StringRef imagePath;  // of the executable
+  StringRef name;
+};
+
+class TesselEvent final : public TesselObject {
+ public:
+  TesselEvent(TracePointFields fields, EmittingProcess process)
+      : TesselObject(TesselClass::event, std::move(fields)), process_(process) {}
+
+  StringRef processImagePath() const { return process_.imagePath; }
+  StringRef processName() const { return process_.name; }
+
+  std::string_view tesselType() const override { return "Event"; }
+  bool canGenerateStatoraPayload() const override { return true; }
+  std::optional<Payload> statoraPayload(ProcessIdentity& identity) const override;
+
+ private:
+  const EmittingProcess process_;
+};
+
+// What an interval carries beyond a trace point. Of the events that opened and closed it, the
+// processes are kept.
+struct IntervalFields {
+  EmittingProcess beginEvent;
+  EmittingProcess endEvent;
+  // Extra attributes, at most one entry per key.
+  std::vector<std::pair<StringRef, StringRef>> attributes;
+};
+
+class TesselInterval : public TesselObject {
+ public:
+  TesselInterval(TracePointFields fields, IntervalFields interval)
+      : TesselInterval(TesselClass::interval, std::move(fields), std::move(interval)) {}
+
+  const EmittingProcess& beginEvent() const { return interval_.beginEvent; }
+  const EmittingProcess& endEvent() const { return interval_.endEvent; }
+  // The attribute's value; absent where there is none under `key`.
+  StringRef attribute(std::string_view key) const;
+
+  std::string_view tesselType() const override { return "Interval"; }
+  bool canGenerateStatoraPayload() const override { return true; }
+  std::optional<Payload> statoraPayload(ProcessIdentity& identity) const override;
+
+ protected:
+  TesselInterval(TesselClass tesselClass, TracePointFields fields, IntervalFields interval)
+      : TesselObject(tesselClass, std::move(fields)), interval_(std::move(interval)) {}
+
+ private:
+  const IntervalFields interval_;
+};
+
+class TesselAnimationInterval final : public TesselInterval {
+ public:
+  TesselAnimationInterval(TracePointFields fields, IntervalFields interval, float frameRate)
+      : TesselInterval(TesselClass::animationInterval, std::move(fields), std::move(interval)),
+        frameRate_(frameRate) {}
+
+  // Frames per second.
+  float frameRate() const { return frameRate_; }
+
+  std::string_view tesselType() const override { return "AnimationInterval"; }
+  std::optional<Payload> statoraPayload(ProcessIdentity& identity) const override;
+
+ private:
+  const float frameRate_;
+};
+
+}  // namespace tessel

@@ -1,0 +1,57 @@
+// TesselSupportObjectExtractor: the trace-extraction service as the service uses it.
+//
+// One extractor serves one run: the callbacks and the option are set, one processing call is made,
+// and processedEventCount() is read after it returned.
+//
+// Delivery: one object per callback call, one call at a time, every call before the processing
+// call returns; a callback may sleep. An animation interval goes to the animation callback only.
+// A delivered object stays valid and unchanged for as long as somebody holds it.
+//
+// Threads: stopProcessing() may be called from any thread, before, during and after processing,
+// and never waits for a callback. Everything else belongs to the thread of the run.
+
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "objects/TesselObject.h"
+#include "platform/Clock.h"
+
+namespace tessel {
+
+// An error of the outside, in words.
+struct PlatformError {
+  std::string localizedDescription;
+};
+
+using IntervalCallback = std::function<bool(const std::shared_ptr<const TesselInterval>&)>;
+using AnimationIntervalCallback = std::function<bool(const std::shared_ptr<const TesselAnimationInterval>&)>;
+using EventCallback = std::function<bool(const std::shared_ptr<const TesselEvent>&)>;
+
+class TesselSupportObjectExtractor {
+ public:
+  virtual ~TesselSupportObjectExtractor() = default;
+
+  virtual void setIntervalCompletionProcessingBlock(IntervalCallback callback) = 0;
+  virtual void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) = 0;
+  virtual void setEmitEventProcessingBlock(EventCallback callback) = 0;
+  virtual void setBuildAnimationCompositeIntervalTimelines(bool build) = 0;
+
+  // Delivers the trace points recorded in [startDate, endDate) from the store at `path`, the
+  // system's own where it is absent. Blocks until all are delivered or a stop took effect. False
+  // where processing failed; `errorOut` then holds why.
+  virtual bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate, Date endDate,
+                                         std::optional<PlatformError>& errorOut) = 0;
+  // Ends the processing call early. A stop before the call began makes it return at once.
+  virtual void stopProcessing() = 0;
+  // Log events that the last processing call read, trace points or not.
+  virtual uint64_t processedEventCount() const = 0;
+};
+
+using ExtractorFactory = std::function<std::shared_ptr<TesselSupportObjectExtractor>()>;
+
+}  // namespace tessel

@@ -1,0 +1,95 @@
+// Records, the seeded hash and the interning table of SharedString.h.
+
+#include "platform/SharedString.h"
+
+#include <cstring>
+#include <limits>
+#include <new>
+#include <random>
+#include <stdexcept>
+
+namespace tessel {
+
+namespace {
+
+uint64_t processSeed() {
+  static const uint64_t seed = [] {
+    std::random_device device;
+    return (uint64_t{device()} << 32) ^ device();
+  }();
+  return seed;
+}
+
+__extension__ using Wide = unsigned __int128;
+
+uint64_t mix(uint64_t a, uint64_t b) {
+  const Wide product = Wide{a} * b;
+  return static_cast<uint64_t>(product) ^ static_cast<uint64_t>(product >> 64);
+}
+
+uint64_t load(const char* at, size_t count) {
+  uint64_t word = 0;
+  std::memcpy(&word, at, count);
+  return word;
+}
+
+}  // namespace
+
+uint64_t hashText(std::string_view text) {
+  constexpr uint64_t kFirst = 0x9e3779b97f4a7c15u;
+  constexpr uint64_t kSecond = 0xd1b54a32d192ed03u;
+  uint64_t state = processSeed() ^ kFirst;
+  const char* at = text.data();
+  size_t left = text.size();
+  for (; left > 16; at += 16, left -= 16) {
+    state = mix(load(at, 8) ^ kFirst ^ state, load(at + 8, 8) ^ kSecond);
+  }
+  const size_t low = left < 8 ? left : 8;
+  state = mix(load(at, low) ^ state, load(at + low, left - low) ^ kSecond ^ state);
+  return mix(state ^ text.size(), kFirst);
+}
+
+SharedString::SharedString(std::string_view text, uint64_t hash) {
+  if (text.size() > std::numeric_limits<uint32_t>::max()) throw std::length_error("SharedString");
+  void* storage = ::operator new(sizeof(StringRecord) + text.size());
+  auto* record = new (storage) StringRecord(hash, static_cast<uint32_t>(text.size()));
+  if (!text.empty()) std::memcpy(static_cast<char*>(storage) + sizeof(StringRecord), text.data(), text.size());
+  record_ = record;
+}
+
+void SharedString::release() {
+  if (record_ == nullptr) return;
+  if (record_->references_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
+  record_->~StringRecord();
+  ::operator delete(const_cast<StringRecord*>(record_));
+}
+
+StringRef StringPool::intern(std::string_view text) {
+  if (size_ * 2 >= slots_.size()) grow();
+  const uint64_t hash = hashText(text);
+  const size_t mask = slots_.size() - 1;
+  for (size_t at = hash & mask;; at = (at + 1) & mask) {
+    SharedString& slot = slots_[at];
+    if (!slot) {
+      slot = SharedString(text, hash);
+      ++size_;
+      textBytes_ += sizeof(StringRecord) + text.size();
+      return slot;
+    }
+    if (slot.hash() == hash && slot.text() == text) return slot;
+  }
+}
+
+void StringPool::grow() {
+  std::vector<SharedString> old(slots_.empty() ? 64 : slots_.size() * 2);
+  old.swap(slots_);
+  const size_t mask = slots_.size() - 1;
+  for (SharedString& kept : old) {
+    if (!kept) continue;
+    size_t at = kept.hash() & mask;
+    while (slots_[at]) at = (at + 1) & mask;
+    slots_[at] = std::move(kept);
+  }
+}
+
+}  // namespace tessel

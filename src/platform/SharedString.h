@@ -1,0 +1,132 @@
+// SharedString, StringRef, StringPool: immutable text that carries its hash and may be absent.
+//
+// A text is stored once, in a reference-counted record that also holds its hash. SharedString owns
+// a share of a record; StringRef borrows one, for as long as somebody else keeps it (a pool, a
+// SharedString). Both are one pointer wide, and null means absent. Copying either never copies
+// text; comparing compares the hash first and looks at the text only where the hashes agree.
+//
+// Absent equals nothing, not even absent, so neither type has operator==: use sameString().
+//
+// Threads: records are immutable and their count is atomic, so handles may be copied and read
+// anywhere. A StringPool is used by one thread at a time while it grows.
+
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace tessel {
+
+// 64-bit hash of `text`, seeded once per process, so that a writer cannot choose collisions.
+uint64_t hashText(std::string_view text);
+
+class StringRecord {
+ public:
+  StringRecord(const StringRecord&) = delete;
+  StringRecord& operator=(const StringRecord&) = delete;
+
+  std::string_view text() const { return {reinterpret_cast<const char*>(this + 1), length_}; }
+  uint64_t hash() const { return hash_; }
+
+ private:
+  friend class SharedString;
+  StringRecord(uint64_t hash, uint32_t length) : hash_(hash), references_(1), length_(length) {}
+
+  const uint64_t hash_;
+  mutable std::atomic<uint32_t> references_;
+  const uint32_t length_;
+};
+
+class SharedString;
+
+// A borrowed string, or absent. Valid while an owner of the record lives.
+class StringRef {
+ public:
+  constexpr StringRef() = default;
+  constexpr explicit StringRef(const StringRecord* record) : record_(record) {}
+
+  bool present() const { return record_ != nullptr; }
+  explicit operator bool() const { return present(); }
+  // REQUIRES: present().
+  std::string_view text() const { return record_->text(); }
+  // The text, or `fallback` where the string is absent.
+  std::string_view textOr(std::string_view fallback) const {
+    return record_ ? record_->text() : fallback;
+  }
+  // The hash; 0 where the string is absent.
+  uint64_t hash() const { return record_ ? record_->hash() : 0; }
+  const StringRecord* record() const { return record_; }
+
+ private:
+  const StringRecord* record_ = nullptr;
+};
+
+// A string that is kept, or absent.
+class SharedString {
+ public:
+  SharedString() = default;
+  // A record of its own for `text`; at most 4 GiB.
+  explicit SharedString(std::string_view text) : SharedString(text, hashText(text)) {}
+  // REQUIRES: hash == hashText(text).
+  SharedString(std::string_view text, uint64_t hash);
+  // Takes a share of a borrowed string.
+  SharedString(StringRef borrowed) : record_(borrowed.record()) { retain(); }
+  SharedString(const SharedString& other) : record_(other.record_) { retain(); }
+  SharedString(SharedString&& other) noexcept : record_(other.record_) { other.record_ = nullptr; }
+  SharedString& operator=(SharedString other) noexcept {
+    std::swap(record_, other.record_);
+    return *this;
+  }
+  ~SharedString() { release(); }
+
+  operator StringRef() const { return StringRef(record_); }
+  bool present() const { return record_ != nullptr; }
+  explicit operator bool() const { return present(); }
+  // REQUIRES: present().
+  std::string_view text() const { return record_->text(); }
+  std::string_view textOr(std::string_view fallback) const { return StringRef(*this).textOr(fallback); }
+  uint64_t hash() const { return StringRef(*this).hash(); }
+
+ private:
+  void retain() {
+    if (record_) record_->references_.fetch_add(1, std::memory_order_relaxed);
+  }
+  void release();
+
+  const StringRecord* record_ = nullptr;
+};
+
+// True when both are present and their texts are equal. An absent string equals nothing.
+inline bool sameString(StringRef a, StringRef b) {
+  if (!a.present() || !b.present()) return false;
+  if (a.record() == b.record()) return true;
+  return a.hash() == b.hash() && a.text() == b.text();
+}
+inline bool sameString(StringRef a, std::string_view b) { return a.present() && a.text() == b; }
+
+// Stores each distinct text once and lends it out; an open-addressing table of records.
+class StringPool {
+ public:
+  StringPool() = default;
+  StringPool(const StringPool&) = delete;
+  StringPool& operator=(const StringPool&) = delete;
+
+  // The one record of this pool for `text`, made on first sight; valid while the pool lives.
+  StringRef intern(std::string_view text);
+  size_t size() const { return size_; }
+  // Bytes held by texts, records and the table.
+  size_t memoryUsed() const { return textBytes_ + slots_.capacity() * sizeof(SharedString); }
+
+ private:
+  void grow();
+
+  std::vector<SharedString> slots_;
+  size_t size_ = 0;
+  size_t textBytes_ = 0;
+};
+
+}  // namespace tessel

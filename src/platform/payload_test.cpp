@@ -1,0 +1,81 @@
+// The payload's order and its JSON form.
+
+#include <gtest/gtest.h>
+
+#include <limits>
+
+#include "platform/Payload.h"
+
+namespace tessel {
+namespace {
+
+TEST(PayloadTest, KeepsTheOrderOfFirstSettingAndLeavesAbsentStringsOut) {
+  Payload payload;
+  payload.set("B", SharedString("two"));
+  payload.set("A", Number{true});
+  payload.set("C", SharedString());
+  payload.set("B", SharedString("three"));
+  EXPECT_EQ(payloadJson(payload), R"({"B":"three","A":true})");
+  EXPECT_EQ(payload.find("C"), nullptr);
+}
+
+TEST(PayloadTest, NumbersKeepTheirKind) {
+  const struct {
+    Number number;
+    const char* text;
+  } cases[] = {
+      {Number{uint64_t{18446744073709551615u}}, "18446744073709551615"},
+      {Number{std::numeric_limits<int64_t>::min()}, "-9223372036854775808"},
+      {Number{0.1f}, "0.1"},
+      {Number{0.1}, "0.1"},
+      {Number{16777217.0}, "16777217"},
+      {Number{1.5f}, "1.5"},
+      {Number{false}, "false"},
+      {Number{std::numeric_limits<float>::quiet_NaN()}, "null"},
+  };
+  for (const auto& c : cases) EXPECT_EQ(numberText(c.number), c.text);
+}
+
+TEST(PayloadTest, TextIsEscapedAndInvalidUtf8Replaced) {
+  const struct {
+    std::string_view text;
+    const char* json;
+  } cases[] = {
+      {"a\"b\\c\n\x01", R"("a\"b\\c\n\u0001")"},
+      {"gr\xc3\xbc\xc3\x9f", "\"gr\xc3\xbc\xc3\x9f\""},
+      {"\xff|\xc3|\xe2\x82|\xed\xa0\x80|\xf0\x9f\x98\x80", "\"\xef\xbf\xbd|\xef\xbf\xbd|\xef\xbf\xbd|\xef\xbf\xbd\xef\xbf\xbd\xef\xbf\xbd|\xf0\x9f\x98\x80\""},
+      {"\xc0\xaf", "\"\xef\xbf\xbd\xef\xbf\xbd\""},
+  };
+  for (const auto& c : cases) {
+    std::string out;
+    appendJsonString(out, c.text);
+    EXPECT_EQ(out, c.json);
+  }
+}
+
+TEST(SharedStringTest, AbsentEqualsNothingAndEqualTextsAgreeOnTheirHash) {
+  const SharedString absent;
+  const SharedString one("one");
+  const SharedString other("one");
+  EXPECT_FALSE(sameString(absent, absent));
+  EXPECT_FALSE(sameString(absent, one));
+  EXPECT_FALSE(sameString(absent, std::string_view()));
+  EXPECT_TRUE(sameString(one, other));
+  EXPECT_EQ(one.hash(), other.hash());
+  EXPECT_EQ(absent.hash(), 0u);
+  EXPECT_FALSE(sameString(one, SharedString("One")));
+}
+
+TEST(SharedStringTest, PoolKeepsOneRecordPerText) {
+  StringPool pool;
+  std::vector<StringRef> refs;
+  for (int i = 0; i < 1000; ++i) refs.push_back(pool.intern("text" + std::to_string(i % 300)));
+  EXPECT_EQ(pool.size(), 300u);
+  for (size_t i = 0; i < refs.size(); ++i) {
+    EXPECT_EQ(refs[i].record(), refs[i % 300].record());
+    EXPECT_EQ(refs[i].text(), "text" + std::to_string(i % 300));
+  }
+}
+
+}  // namespace
+}  // namespace tessel

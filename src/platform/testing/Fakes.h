@@ -1,0 +1,185 @@
+// Small working fakes of the platform's roles, with switches. For tests only.
+
+#pragma once
+
+#include <deque>
+#include <map>
+#include <mutex>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Activity.h"
+#include "platform/Analytics.h"
+#include "platform/Clock.h"
+#include "platform/Log.h"
+#include "platform/Runtime.h"
+#include "platform/SerialQueue.h"
+#include "platform/System.h"
+
+namespace tessel::testing {
+
+// Remembers log lines while it lives; takes the place of the sink that was installed.
+class RecordingLog final : public LogSink {
+ public:
+  explicit RecordingLog(LogLevel level = LogLevel::debug) { setLogSink(this, level); }
+  ~RecordingLog() override { setLogSink(nullptr, LogLevel::error); }
+
+  void write(LogLevel level, std::string_view subsystem, std::string_view category,
+             std::string_view text) override;
+  std::vector<std::string> lines() const;
+  std::vector<std::string> errors() const;
+  // How many lines read exactly `text`.
+  size_t count(std::string_view text) const;
+  void clear();
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<std::pair<LogLevel, std::string>> lines_;
+};
+
+// A clock in nanosecond ticks that moves only when told to, by a sleep or by a wait that times out.
+class FakeClock final : public Clock {
+ public:
+  uint64_t continuousTicks() override { return ticks; }
+  Timebase timebase() override { return base; }
+  Date now() override { return date; }
+  void sleepMicroseconds(uint32_t microseconds) override;
+  // Runs `whileWaiting`, then advances by the whole timeout where nothing was signalled.
+  bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
+  void advance(std::chrono::nanoseconds by);
+
+  uint64_t ticks = 1'000'000'000;
+  Timebase base{1, 1};
+  Date date{std::chrono::seconds{1'795'000'000}};
+  std::vector<uint32_t> sleeps;
+  std::vector<std::chrono::nanoseconds> waits;
+  Closure whileWaiting;
+};
+
+// A queue that runs what it holds when told to. sync() runs everything before it, too.
+class ManualQueue final : public SerialQueue {
+ public:
+  explicit ManualQueue(std::string label) : label_(std::move(label)) {}
+  const std::string& label() const override { return label_; }
+  void async(Closure work) override { work_.push_back(std::move(work)); }
+  void sync(const Closure& work) override;
+  // Runs what is queued, and what that queues.
+  void runAll();
+  size_t pending() const { return work_.size(); }
+
+ private:
+  const std::string label_;
+  std::deque<Closure> work_;
+};
+
+struct ManualTimer final : RepeatingTimer {
+  void resume() override { resumed = true; }
+  // Submits the handler to the queue, as a firing does.
+  void fire() { queue->async(handler); }
+
+  std::shared_ptr<SerialQueue> queue;
+  std::chrono::nanoseconds interval{};
+  std::chrono::nanoseconds leeway{};
+  Closure handler;
+  bool resumed = false;
+};
+
+struct ManualQueueFactory final : QueueFactory {
+  std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;
+  std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
+                                                     std::chrono::nanoseconds interval,
+                                                     std::chrono::nanoseconds leeway, Closure handler) override;
+  void runAll();
+
+  std::vector<std::shared_ptr<ManualQueue>> queues;
+  std::vector<std::shared_ptr<ManualTimer>> timers;
+};
+
+struct FakeActivity final : Activity {
+  int64_t state() override { return currentState; }
+  bool shouldDefer() override { return deferWanted; }
+  bool setState(int64_t wanted) override;
+
+  int64_t currentState = kActivityStateRun;
+  bool deferWanted = false;
+  bool takesStates = true;
+  std::vector<int64_t> statesSet;
+};
+
+// Remembers what was asked of it, in order, in `calls`.
+struct FakeRuntime final : Runtime {
+  std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) override;
+  void requestCleanExit() override { calls.push_back("clean exit"); }
+  std::shared_ptr<SignalSource> makeSignalSource(int, std::shared_ptr<SerialQueue>) override { return nullptr; }
+  [[noreturn]] void runMainLoop() override;
+
+  std::vector<std::string> calls;
+};
+
+struct SentEvent {
+  std::string name;
+  std::string json;
+};
+
+// An analytics service that remembers.
+struct RememberingSender final : EventSender {
+  bool sendEvent(std::string_view name, const Payload& payload) override;
+  std::vector<std::string> names() const;
+
+  std::vector<SentEvent> events;
+  bool takesEvents = true;
+};
+
+struct FakeConfigurationObserver final : ConfigurationObserver {
+  void setDelegate(std::shared_ptr<ConfigurationObserverDelegate> delegateIn,
+                   std::shared_ptr<SerialQueue> queueIn) override;
+  void startObserving(const std::string& type) override { observed.push_back(type); }
+  // Submits one call to the delegate on its queue.
+  void deliver(std::shared_ptr<const ConfigurationValue> configuration, std::string type);
+
+  std::shared_ptr<ConfigurationObserverDelegate> delegate;
+  std::shared_ptr<SerialQueue> queue;
+  std::vector<std::string> observed;
+};
+
+struct FakeConfigurationService final : ConfigurationService {
+  std::shared_ptr<ConfigurationObserver> makeObserver() override;
+  std::vector<std::shared_ptr<FakeConfigurationObserver>> observers;
+};
+
+struct FakeFiles final : FileManager {
+  FileExistence existence(const std::string& path) override;
+  bool createFile(const std::string& path) override;
+  RemovalResult remove(const std::string& path) override;
+
+  std::map<std::string, bool> items;  // path to "is a directory"
+  bool canCreate = true;
+  std::optional<RemovalResult> removal;  // what a removal answers instead of removing
+};
+
+struct FakeVolumes final : Volumes {
+  std::optional<std::string> rootFilesystemTypeName() override { return type; }
+  std::optional<std::string> type = "ext4";
+};
+
+struct FakeBundles final : BundleReader {
+  std::optional<std::string> bundleIdentifier(const std::string& directory) override;
+  std::map<std::string, std::string> identifiers;
+  std::vector<std::string> asked;
+};
+
+struct FakeBuildVariant final : BuildVariant {
+  bool hasInternalDiagnostics(std::string_view subsystem) override;
+  bool internal = false;
+  size_t asked = 0;
+  std::string lastSubsystem;
+};
+
+// Formats a date as its seconds since 1970.
+struct FakeDates final : DateFormatter {
+  std::string format(Date date) override;
+};
+
+}  // namespace tessel::testing

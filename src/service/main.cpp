@@ -1,0 +1,2 @@
+// Composition root of the service.
+int main() { return 0; }
