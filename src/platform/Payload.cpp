@@ -6,6 +6,8 @@ namespace tessel {
 
 namespace {
 
+constexpr std::string_view kReplacementCharacter = "\xef\xbf\xbd";
+
 struct Utf8Step {
   size_t length;  // bytes consumed
   bool valid;
@@ -99,12 +101,26 @@ bool isValidUtf8(std::string_view text) {
   return true;
 }
 
+std::string replaceInvalidUtf8(std::string_view text) {
+  std::string out;
+  for (size_t at = 0; at < text.size();) {
+    const Utf8Step step = utf8Step(text, at);
+    if (step.valid) {
+      out.append(text, at, step.length);
+    } else {
+      out += kReplacementCharacter;
+    }
+    at += step.length;
+  }
+  return out;
+}
+
 void appendJsonString(std::string& out, std::string_view text) {
   out += '"';
   for (size_t at = 0; at < text.size();) {
     const Utf8Step step = utf8Step(text, at);
     if (!step.valid) {
-      out += "\xef\xbf\xbd";
+      out += kReplacementCharacter;
     } else if (step.length == 1) {
       appendEscaped(out, static_cast<unsigned char>(text[at]));
     } else {

@@ -42,6 +42,9 @@ std::string payloadJson(const Payload& payload);
 // Appends `text` as a JSON string literal, invalid UTF-8 replaced as above.
 void appendJsonString(std::string& out, std::string_view text);
 
+// `text` with invalid UTF-8 replaced as above.
+std::string replaceInvalidUtf8(std::string_view text);
+
 // True where `text` is well-formed UTF-8.
 bool isValidUtf8(std::string_view text);
 

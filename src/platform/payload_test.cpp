@@ -51,6 +51,7 @@ TEST(PayloadTest, TextIsEscapedAndInvalidUtf8Replaced) {
     appendJsonString(out, c.text);
     EXPECT_EQ(out, c.json);
   }
+  EXPECT_EQ(replaceInvalidUtf8("\xff|\"gr\xc3\xbc\xc3"), "\xef\xbf\xbd|\"gr\xc3\xbc\xef\xbf\xbd");
 }
 
 TEST(SharedStringTest, AbsentEqualsNothingAndEqualTextsAgreeOnTheirHash) {
