@@ -19,6 +19,8 @@ namespace tessel {
 
 using FieldToken = uint32_t;
 inline constexpr FieldToken kNoToken = 0;
+// Tokens from here on belong to the store itself; a tokenizer stays below.
+inline constexpr FieldToken kFirstReservedToken = 0x80000000;
 
 using Id128 = std::array<uint8_t, 16>;
 
@@ -34,7 +36,8 @@ class FieldTokenizer {
   // Whether a field of this name can ever have a token; asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
   // The token of one FIELD=value. `head` is its beginning, up to kMaxFieldHead bytes; `size` its
-  // whole length in bytes. The same text may be shown more than once.
+  // whole length in bytes, as far as known: where `head` is only its beginning, it may be any number
+  // greater than head.size(). The same text may be shown more than once.
   virtual FieldToken tokenFor(std::string_view head, uint64_t size) = 0;
   // Changes when all tokens handed out so far become void (the tokenizer was emptied to stay within
   // its memory); a reader then drops what it remembers and asks again. Changes only inside
