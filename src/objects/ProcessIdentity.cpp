@@ -1,0 +1,63 @@
+// The walk from an executable image up to its bundle.
+
+#include "objects/ProcessIdentity.h"
+
+#include "platform/Log.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr int kExaminedDirectoriesLimit = 100;
+
+std::string_view withoutTrailingSeparators(std::string_view path) {
+  const size_t last = path.find_last_not_of('/');
+  return last == std::string_view::npos ? std::string_view() : path.substr(0, last + 1);
+}
+
+std::string_view lastComponent(std::string_view path) {
+  const std::string_view trimmed = withoutTrailingSeparators(path);
+  return trimmed.substr(trimmed.rfind('/') +
+                        1);  // rfind() finding none gives npos, and that plus 1 is 0
+}
+
+// "/" for a path directly below the root, and empty for a single relative component.
+std::string_view parent(std::string_view path) {
+  const std::string_view trimmed = withoutTrailingSeparators(path);
+  const size_t separator = trimmed.rfind('/');
+  if (separator == std::string_view::npos) return path.substr(0, path.starts_with('/') ? 1 : 0);
+  const std::string_view above = withoutTrailingSeparators(trimmed.substr(0, separator));
+  return above.empty() ? path.substr(0, 1) : above;
+}
+
+// The nearest directory above the image that is named after it; empty where there is none.
+std::string_view bundleDirectoryAbove(std::string_view imagePath) {
+  const std::string prefix = std::string(lastComponent(imagePath)) + ".";
+  std::string_view directory = parent(imagePath);
+  for (int examined = 0; examined < kExaminedDirectoriesLimit; ++examined) {
+    if (directory.empty() || directory == "/") return {};
+    if (lastComponent(directory).starts_with(prefix)) return directory;
+    directory = parent(directory);
+  }
+  return {};
+}
+
+}  // namespace
+
+SharedString ProcessIdentity::bundleIdentifierForImagePath(StringRef imagePath) {
+  if (!imagePath.present()) return {};
+  const auto known = bundleIdentifierCache_.find(imagePath);
+  if (known != bundleIdentifierCache_.end()) return known->second;
+  return bundleIdentifierCache_.emplace(imagePath, search(imagePath.text())).first->second;
+}
+
+SharedString ProcessIdentity::search(std::string_view imagePath) {
+  const std::string_view directory = bundleDirectoryAbove(imagePath);
+  if (directory.empty()) return {};
+  const auto identifier = bundles_.bundleIdentifier(std::string(directory));
+  if (!identifier) return {};
+  tesselReporterLog().debug("Found bundle ID: \"%@\" for path:\"%@\"", *identifier, imagePath);
+  return SharedString(*identifier);
+}
+
+}  // namespace tessel
