@@ -1,0 +1,158 @@
+// The decision and its counting.
+
+#include "filter/TesselReporterObjectFilter.h"
+
+#include <type_traits>
+#include <utility>
+
+#include "filter/DefaultDownsampling.h"
+#include "whitelist/StringWhitelist.h"
+
+namespace tessel {
+
+static_assert(std::is_trivially_copyable_v<FilterDecision>, "one is made for every object");
+
+namespace {
+
+const TesselObject* asTesselObject(const TesselSupportObject& object) {
+  return object.isKindOf(TesselClass::object) ? static_cast<const TesselObject*>(&object) : nullptr;
+}
+
+FilterDecision& failSlot(FilterDecision& decision, uint8_t slot, StringRef label, StringRef value) {
+  decision.stringSlot = slot;
+  decision.stringLabel = label;
+  decision.stringValue = value;
+  return decision;
+}
+
+// Says which slot of a performance-logging operation is at fault.
+void failSpecialRule(const TesselObject& object, FilterDecision& decision) {
+  decision.specialRule = true;
+  const StringRef component = object.string1Value();
+  if (component.present() && perfLoggingComponentSet().contains(component)) {
+    failSlot(decision, 2, object.string2Name(), object.string2Value());
+  } else {
+    failSlot(decision, 1, object.string1Name(), component);
+  }
+}
+
+}  // namespace
+
+std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::init(
+    BuildVariant& variant) {
+  return initWithPlatform(currentPlatform(), variant);
+}
+
+std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::initWithPlatform(
+    TesselReporterPlatform platform, BuildVariant& variant) {
+  if (platform == TesselReporterPlatform::unknown) return nullptr;
+  return std::shared_ptr<TesselReporterObjectFilter>(
+      new TesselReporterObjectFilter(platform, variant));
+}
+
+TesselReporterObjectFilter::TesselReporterObjectFilter(TesselReporterPlatform platform,
+                                                       BuildVariant& variant)
+    : platform_(platform), variant_(variant), scnFilter_(defaultFilterForPlatform(platform)) {}
+
+bool TesselReporterObjectFilter::shouldReportTesselObject(
+    const TesselSupportObject& object, TesselReporterClassification* classificationOut) {
+  const FilterDecision decision = inspectTesselObject(object);
+  if (classificationOut != nullptr) *classificationOut = decision.classification;
+  return decision.shouldReport();
+}
+
+FilterDecision TesselReporterObjectFilter::inspectTesselObject(const TesselSupportObject& object) {
+  const FilterDecision decision = decide(object);
+  incrementTotalForObject(object, decision.classification);
+  return decision;
+}
+
+FilterDecision TesselReporterObjectFilter::decide(const TesselSupportObject& supportObject) const {
+  FilterDecision decision;
+  const TesselObject* object = asTesselObject(supportObject);
+  if (object == nullptr || !object->canGenerateStatoraPayload()) {
+    decision.classification = TesselReporterClassificationClassNotSupported;
+  } else if (!object->telemetryEnabled()) {
+    decision.classification = TesselReporterClassificationTelemetryDisabled;
+  } else if (object->durationSeconds() < 0.0F) {
+    decision.classification = TesselReporterClassificationDurationThreshold;
+    decision.durationSeconds = object->durationSeconds();
+  } else if (!objectPassesStringFilter(*object, decision)) {
+    decision.classification = TesselReporterClassificationFailedStringWhitelist;
+  } else if (!objectPassesDownsampling(*object, decision)) {
+    decision.classification = TesselReporterClassificationFailedSCFilter;
+  }
+  return decision;
+}
+
+// The special rule comes before the build variant is asked, so it holds on every build.
+bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& object,
+                                                          FilterDecision& decision) const {
+  const bool special = platform_ == TesselReporterPlatform::quarro &&
+                       isPerfLoggingOperation(object.subsystem(), object.category(), object.name());
+  if (special && !perfLoggingOperationStringsPass(object.string1Value(), object.string2Value())) {
+    failSpecialRule(object, decision);
+    return false;
+  }
+  if (!shouldUseStringWhitelist(variant_) || special) return true;
+  return slotPasses(1, object.string1Name(), object.string1Value(), decision) &&
+         slotPasses(2, object.string2Name(), object.string2Value(), decision);
+}
+
+// A slot without a label is not tested, whatever its value.
+bool TesselReporterObjectFilter::slotPasses(uint8_t slot, StringRef label, StringRef value,
+                                            FilterDecision& decision) const {
+  if (!label.present() || stringIsWhitelisted(value, platform_)) return true;
+  failSlot(decision, slot, label, value);
+  return false;
+}
+
+bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& object,
+                                                          FilterDecision& decision) const {
+  if (scnFilter_ == nullptr) return true;
+  TRDownsampleEntry* entry = scnFilter_->downsampleEntryForObject(object);
+  decision.downsampleEntry = entry;
+  return entry == nullptr || entry->shouldReportThisTime();
+}
+
+void TesselReporterObjectFilter::incrementTotalForObject(
+    const TesselSupportObject& object, TesselReporterClassification classification) {
+  const TesselObject* point = asTesselObject(object);
+  const StringRef subsystem = point ? point->subsystem() : StringRef();
+  const StringRef category = point ? point->category() : StringRef();
+
+  allInspected_.incrementSubsystem(subsystem, category);
+  if (Aggregation* aggregation = aggregationFor(classification))
+    aggregation->incrementSubsystem(subsystem, category);
+
+  const bool reported = classification == TesselReporterClassificationTelemetryReported;
+  if (object.isKindOf(TesselClass::animationInterval)) {
+    animations_.count(reported);
+  } else if (object.isKindOf(TesselClass::interval)) {
+    intervals_.count(reported);
+  } else if (object.isKindOf(TesselClass::event)) {
+    events_.count(reported);
+    if (reported) reportedEvents_.incrementSubsystem(subsystem, category);
+  }
+}
+
+TesselReporterAggregation* TesselReporterObjectFilter::aggregationFor(
+    TesselReporterClassification classification) {
+  switch (classification) {
+    case TesselReporterClassificationTelemetryDisabled:
+      return &disabled_;
+    case TesselReporterClassificationTelemetryReported:
+      return &reported_;
+    case TesselReporterClassificationFailedStringWhitelist:
+      return &failedStringWhitelist_;
+    case TesselReporterClassificationDurationThreshold:
+      return &durationThreshold_;
+    case TesselReporterClassificationFailedSCFilter:
+      return &failedSCFilter_;
+    case TesselReporterClassificationClassNotSupported:
+      return &classNotSupported_;
+  }
+  return nullptr;
+}
+
+}  // namespace tessel

@@ -1,0 +1,346 @@
+// The decision about an object, its explanation and its counting.
+
+#include "filter/TesselReporterObjectFilter.h"
+
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <functional>
+#include <limits>
+#include <random>
+#include <set>
+
+#include "filter/DefaultDownsampling.h"
+#include "objects/testing/TestObjects.h"
+#include "platform/testing/Fakes.h"
+
+namespace tessel {
+namespace {
+
+using testing::FakeBuildVariant;
+using testing::makeAnimationInterval;
+using testing::makeEvent;
+using testing::makeInterval;
+using testing::makeObject;
+using testing::TestPoint;
+using Platform = TesselReporterPlatform;
+
+// What can be wrong with an object, in the order in which it is checked.
+enum Fault { kClass, kTelemetry, kDuration, kString, kDownsampling };
+
+constexpr TesselReporterClassification kClassificationOfFault[] = {
+    TesselReporterClassificationClassNotSupported, TesselReporterClassificationTelemetryDisabled,
+    TesselReporterClassificationDurationThreshold,
+    TesselReporterClassificationFailedStringWhitelist, TesselReporterClassificationFailedSCFilter};
+
+// An object with these faults and no other, for a filter with the Selvin downsampling.
+std::shared_ptr<const TesselObject> faultyObject(const std::set<Fault>& faults) {
+  TestPoint point;
+  if (faults.contains(kTelemetry)) point.telemetryEnabled = false;
+  if (faults.contains(kDuration)) point.durationSeconds = -0.001F;
+  point.string1Name = "period";
+  point.string1Value = faults.contains(kString) ? "weekly" : "week";
+  if (faults.contains(kDownsampling)) {
+    point.subsystem = "com.vantor.quellan.knowledge";
+    point.category = "tessel";
+    point.name = "Footprint";
+  }
+  if (faults.contains(kClass)) return makeObject(point);
+  return makeEvent(point);
+}
+
+class ObjectFilterTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<TesselReporterObjectFilter> makeFilter(Platform platform) {
+    auto made = TesselReporterObjectFilter::initWithPlatform(platform, variant);
+    made->setScnFilter(makeDefaultFilterForPlatform(platform));
+    return made;
+  }
+  TesselReporterClassification classify(const TesselSupportObject& object) {
+    return filter->inspectTesselObject(object).classification;
+  }
+
+  FakeBuildVariant variant;
+  std::shared_ptr<TesselReporterObjectFilter> filter = makeFilter(Platform::selvin);
+};
+
+TEST_F(ObjectFilterTest, TheFirstFailingCheckDecides) {
+  EXPECT_EQ(classify(*faultyObject({})), TesselReporterClassificationTelemetryReported);
+  for (const Fault first : {kClass, kTelemetry, kDuration, kString, kDownsampling}) {
+    for (const Fault second : {kClass, kTelemetry, kDuration, kString, kDownsampling}) {
+      if (second < first) continue;
+      SCOPED_TRACE("faults " + std::to_string(first) + " and " + std::to_string(second));
+      const auto object = faultyObject({first, second});
+      auto classification = TesselReporterClassificationTelemetryReported;
+      EXPECT_FALSE(filter->shouldReportTesselObject(*object, &classification));
+      EXPECT_EQ(classification, kClassificationOfFault[first]);
+    }
+  }
+}
+
+TEST_F(ObjectFilterTest, WhatIsNoTracePointIsNotSupported) {
+  const TesselSupportObject object;
+  EXPECT_EQ(classify(object), TesselReporterClassificationClassNotSupported);
+  EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), 1u);
+  EXPECT_EQ(filter->totalUnreportedEventCount(), 0u);
+}
+
+TEST_F(ObjectFilterTest, OnlyADurationBelowZeroIsTooShort) {
+  const struct {
+    float seconds;
+    bool reported;
+  } cases[] = {{0.0F, true},
+               {-0.0F, true},
+               {-0.001F, false},
+               {-std::numeric_limits<float>::denorm_min(), false},
+               {std::numeric_limits<float>::quiet_NaN(), true},
+               {-std::numeric_limits<float>::infinity(), false},
+               {1.5F, true}};
+  for (const auto& row : cases) {
+    TestPoint point;
+    point.durationSeconds = row.seconds;
+    EXPECT_EQ(filter->shouldReportTesselObject(*makeEvent(point), nullptr), row.reported)
+        << row.seconds;
+  }
+}
+
+TEST_F(ObjectFilterTest, DownsamplingIsAskedOnlyAboutWhatPassedEverythingElse) {
+  const auto held = faultyObject({kDownsampling});
+  const auto* entry = filter->scnFilter()->downsampleEntryForObject(*held);
+  for (const Fault fault : {kClass, kTelemetry, kDuration, kString}) {
+    classify(*faultyObject({fault, kDownsampling}));
+  }
+  EXPECT_EQ(entry->eventsSeen(), 0u);
+  classify(*held);
+  EXPECT_EQ(entry->eventsSeen(), 1u);
+
+  filter->setScnFilter(nullptr);
+  EXPECT_EQ(classify(*held), TesselReporterClassificationTelemetryReported);
+}
+
+TEST_F(ObjectFilterTest, ADecisionNamesWhatDecided) {
+  TestPoint point;
+  point.string1Name = "period";
+  point.string1Value = "week";
+  point.string2Name = "size";
+  point.string2Value = "huge";
+  const auto second = makeEvent(point);
+  FilterDecision decision = filter->inspectTesselObject(*second);
+  EXPECT_EQ(decision.stringSlot, 2);
+  EXPECT_EQ(decision.stringLabel.textOr(""), "size");
+  EXPECT_EQ(decision.stringValue.textOr(""), "huge");
+  EXPECT_FALSE(decision.specialRule);
+
+  point.string1Value = {};
+  const auto first = makeEvent(point);
+  decision = filter->inspectTesselObject(*first);
+  EXPECT_EQ(decision.stringSlot, 1);
+  EXPECT_EQ(decision.stringLabel.textOr(""), "period");
+  EXPECT_FALSE(decision.stringValue.present());
+
+  decision = filter->inspectTesselObject(*faultyObject({kDuration}));
+  EXPECT_EQ(decision.durationSeconds, -0.001F);
+  EXPECT_EQ(decision.stringSlot, 0);
+  EXPECT_EQ(decision.downsampleEntry, nullptr);
+
+  decision = filter->inspectTesselObject(*faultyObject({kDownsampling}));
+  ASSERT_NE(decision.downsampleEntry, nullptr);
+  EXPECT_EQ(decision.downsampleEntry->cap(), 0u);
+  EXPECT_EQ(decision.downsampleEntry->eventsSeen(), 1u);
+  EXPECT_FALSE(decision.shouldReport());
+}
+
+struct PerfLoggingCase {
+  const char* component;
+  const char* action;
+  bool passes;
+  int failingSlot;
+};
+
+TEST_F(ObjectFilterTest, QuarroHasARuleOfItsOwnOnEveryBuild) {
+  const PerfLoggingCase cases[] = {{"ApplicationWindow", "Open", true, 0},
+                                   {"Open", "ApplicationWindow", false, 1},
+                                   {"ApplicationWindow", "Ajar", false, 2},
+                                   {"ApplicationWindow", nullptr, false, 2},
+                                   {nullptr, "Open", false, 1}};
+  for (const bool internal : {false, true}) {
+    variant.internal = internal;
+    const auto quarro = makeFilter(Platform::quarro);
+    for (const auto& row : cases) {
+      const testing::RecordingLog log;
+      TestPoint point;
+      point.subsystem = "com.vantor.PerformanceAnalysis";
+      point.category = "PerfLogging";
+      point.name = "PerfLoggingOperation";
+      if (row.component) point.string1Value = row.component;
+      if (row.action) point.string2Value = row.action;
+      const auto decision = quarro->inspectTesselObject(*makeEvent(point));
+      EXPECT_EQ(decision.shouldReport(), row.passes) << internal << row.failingSlot;
+      EXPECT_EQ(decision.stringSlot, row.failingSlot);
+      EXPECT_EQ(decision.specialRule, !row.passes);
+      // Where the rule fails the object, nobody asks which whitelist mode is on.
+      EXPECT_EQ(log.lines().size(), row.passes ? 1u : 0u);
+    }
+  }
+}
+
+TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
+  TestPoint point;
+  point.subsystem = "com.vantor.PerformanceAnalysis";
+  point.category = "PerfLogging";
+  point.name = "PerfLoggingOperation";
+  point.string1Name = "component";
+  point.string1Value = "ApplicationWindow";
+  point.string2Name = "action";
+  point.string2Value = "Open";
+  EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
+  // On another platform it is an object like any other, and these are no values of that platform.
+  EXPECT_FALSE(filter->shouldReportTesselObject(*makeEvent(point), nullptr));
+  // Of another name it is one on Quarro, too, where both values are known.
+  point.name = "Other";
+  point.string1Value = "Open";
+  EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
+}
+
+TEST_F(ObjectFilterTest, ASlotIsTestedOnlyWhereItIsLabelled) {
+  using Text = TestPoint::Text;
+  const struct {
+    Text label1, value1, label2, value2;
+    bool passes;
+  } cases[] = {{{}, {}, {}, {}, true},
+               {{}, "anything", {}, "anything", true},
+               {"label", "week", {}, "anything", true},
+               {"label", "Week", {}, {}, false},
+               {"label", {}, {}, {}, false},
+               {{}, "anything", "label", "small", true},
+               {{}, {}, "label", "tiny", false},
+               {{}, {}, "label", {}, false},
+               {"label", "week", "label", "small", true},
+               {"unknown label", "2,2,1,0", "", "Root", true}};
+  for (const auto& row : cases) {
+    TestPoint point;
+    point.string1Name = row.label1;
+    point.string1Value = row.value1;
+    point.string2Name = row.label2;
+    point.string2Value = row.value2;
+    const auto object = makeEvent(point);
+    variant.internal = false;
+    EXPECT_EQ(filter->shouldReportTesselObject(*object, nullptr), row.passes)
+        << row.value1.value_or("-") << " " << row.value2.value_or("-");
+    variant.internal = true;
+    EXPECT_TRUE(filter->shouldReportTesselObject(*object, nullptr));
+  }
+}
+
+TEST_F(ObjectFilterTest, TheBuildVariantIsAskedForEveryObjectThatGetsThere) {
+  const testing::RecordingLog log;
+  for (int i = 0; i < 3; ++i) classify(*faultyObject({}));
+  classify(*faultyObject({kDuration}));
+  EXPECT_EQ(variant.asked, 3u);
+  EXPECT_EQ(variant.lastSubsystem, "com.vantor.tessel");
+  EXPECT_EQ(log.count("Defaulting to using string whitelist"), 3u);
+}
+
+using MakeObject = std::function<std::shared_ptr<const TesselObject>(const TestPoint&)>;
+
+TEST_F(ObjectFilterTest, CountsEachKindOnce) {
+  const struct {
+    MakeObject make;
+    uint64_t (TesselReporterObjectFilter::*reported)() const;
+    uint64_t (TesselReporterObjectFilter::*unreported)() const;
+    uint64_t reportedEvents;
+  } kinds[] = {
+      {makeEvent, &TesselReporterObjectFilter::totalReportedEventCount,
+       &TesselReporterObjectFilter::totalUnreportedEventCount, 2},
+      {makeInterval, &TesselReporterObjectFilter::totalReportedIntervalCount,
+       &TesselReporterObjectFilter::totalUnreportedIntervalCount, 0},
+      {makeAnimationInterval, &TesselReporterObjectFilter::totalReportedAnimationCount,
+       &TesselReporterObjectFilter::totalUnreportedAnimationCount, 0},
+  };
+  for (const auto& kind : kinds) {
+    filter = makeFilter(Platform::selvin);
+    TestPoint point;
+    filter->inspectTesselObject(*kind.make(point));
+    filter->inspectTesselObject(*kind.make(point));
+    point.telemetryEnabled = false;
+    filter->inspectTesselObject(*kind.make(point));
+    EXPECT_EQ((*filter.*kind.reported)(), 2u);
+    EXPECT_EQ((*filter.*kind.unreported)(), 1u);
+    EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(), kind.reportedEvents);
+    EXPECT_EQ(filter->totalReportedEventCount() + filter->totalUnreportedEventCount() +
+                  filter->totalReportedIntervalCount() + filter->totalUnreportedIntervalCount() +
+                  filter->totalReportedAnimationCount() + filter->totalUnreportedAnimationCount(),
+              3u);
+  }
+}
+
+TEST_F(ObjectFilterTest, ACodeOutsideTheEnumerationIsInspectedAndNotReported) {
+  filter->incrementTotalForObject(*makeInterval({}), static_cast<TesselReporterClassification>(6));
+  EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), 1u);
+  EXPECT_EQ(filter->totalUnreportedIntervalCount(), 1u);
+  EXPECT_EQ(filter->telemetryReportedAggregation().totalCount(), 0u);
+}
+
+std::vector<const TesselReporterAggregation*> perClassification(
+    const TesselReporterObjectFilter& filter) {
+  return {&filter.telemetryDisabledAggregation(),
+          &filter.telemetryReportedAggregation(),
+          &filter.telemetryNotReportedFailedStringWhitelistAggregation(),
+          &filter.telemetryNotReportedDurationThresholdAggregation(),
+          &filter.telemetryNotReportedFailedSCFilterAggregation(),
+          &filter.telemetryNotReportedClassNotSupportedAggregation()};
+}
+
+TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderExactlyOneReason) {
+  std::mt19937 random(20261122);
+  const auto chance = [&random](unsigned in) { return random() % in == 0; };
+  uint64_t expected[6] = {};
+  constexpr uint64_t kCalls = 5000;
+  for (uint64_t i = 0; i < kCalls; ++i) {
+    TestPoint point;
+    point.subsystem = "com.vantor.S" + std::to_string(random() % 5);
+    if (chance(7)) point.subsystem = "com.vantor.TextInput";
+    point.category = "C" + std::to_string(random() % 3);
+    if (chance(20)) point.category = {};
+    point.telemetryEnabled = !chance(5);
+    point.durationSeconds = chance(5) ? -1.0F : 1.0F;
+    if (chance(2)) {
+      point.string1Name = "period";
+      point.string1Value = chance(3) ? "never" : "day";
+    }
+    const MakeObject makers[] = {makeObject, makeEvent, makeInterval, makeAnimationInterval};
+    const FilterDecision decision = filter->inspectTesselObject(*makers[random() % 4](point));
+    ++expected[decision.classification];
+  }
+  const auto aggregations = perClassification(*filter);
+  for (size_t code = 0; code < aggregations.size(); ++code) {
+    EXPECT_EQ(aggregations[code]->totalCount(), expected[code]) << code;
+    EXPECT_GT(expected[code], 0u) << code;
+    uint64_t sum = 0;
+    for (const auto& entry : aggregations[code]->aggregationDictionary()) sum += entry.count;
+    EXPECT_EQ(sum, expected[code]);
+  }
+  EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), kCalls);
+  EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(),
+            filter->totalReportedEventCount());
+  EXPECT_EQ(filter->totalReportedEventCount() + filter->totalReportedIntervalCount() +
+                filter->totalReportedAnimationCount(),
+            filter->telemetryReportedAggregation().totalCount());
+}
+
+TEST_F(ObjectFilterTest, APlatformMakesTheFilter) {
+  EXPECT_EQ(TesselReporterObjectFilter::initWithPlatform(Platform::unknown, variant), nullptr);
+  const auto own = TesselReporterObjectFilter::init(variant);
+  EXPECT_EQ(own->platform(), Platform::selvin);
+  EXPECT_EQ(own->scnFilter(), defaultFilterForPlatform(Platform::selvin));
+  EXPECT_NE(own->scnFilter(), nullptr);
+  for (const uint64_t code : {3u, 5u, 6u}) {
+    const auto other =
+        TesselReporterObjectFilter::initWithPlatform(static_cast<Platform>(code), variant);
+    EXPECT_EQ(static_cast<uint64_t>(other->platform()), code);
+    EXPECT_EQ(other->scnFilter(), nullptr);
+  }
+}
+
+}  // namespace
+}  // namespace tessel
