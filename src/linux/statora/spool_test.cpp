@@ -1,0 +1,379 @@
+// The spool on real files: what it stores, what it survives, what it refuses.
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sched.h>
+#include <sqlite3.h>
+#include <sys/mount.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <random>
+
+#include "linux/statora/Spool.h"
+#include "linux/statora/SpoolDatabase.h"
+#include "linux/testing/TemporaryDirectory.h"
+#include "platform/testing/Fakes.h"
+
+namespace {
+std::atomic<uint64_t> flushes;
+}
+
+// Stands before the C library's for this program and the libraries that it uses.
+extern "C" int fdatasync(int file) {
+  ++flushes;
+  return static_cast<int>(syscall(SYS_fdatasync, file));
+}
+
+namespace tessel {
+namespace {
+
+using ::testing::ElementsAre;
+using testing::FakeClock;
+using ::testing::HasSubstr;
+using testing::RecordingLog;
+using testing::TemporaryDirectory;
+
+Payload numbered(int64_t number) {
+  Payload payload;
+  payload.set("Number", Number{number});
+  return payload;
+}
+
+Payload ofSize(size_t bytes) {
+  Payload payload;
+  payload.set("Text", SharedString(std::string(bytes, 'x')));
+  return payload;
+}
+
+// Looks at a spool as any other client would.
+class Reader {
+ public:
+  explicit Reader(const std::string& directory, const std::string& name = kSpoolFileName) {
+    EXPECT_TRUE(database_.open(directory + "/" + name, SqliteDatabase::Mode::readWrite).ok());
+  }
+  std::vector<std::string> rows() {
+    std::vector<std::string> all;
+    SqliteStatement select =
+        database_.prepare("SELECT time, name, payload FROM events ORDER BY id");
+    while (select.prepared() && select.step() == SqliteStatement::Step::row) {
+      all.push_back(std::string(select.text(0)) + " " + std::string(select.text(1)) + " " +
+                    std::string(select.text(2)));
+    }
+    return all;
+  }
+  int64_t count() { return database_.integer("SELECT count(*) FROM events").value_or(-1); }
+  std::string integrity() {
+    return database_.text("PRAGMA integrity_check").value_or("unreadable");
+  }
+  SqliteDatabase& database() { return database_; }
+
+ private:
+  SqliteDatabase database_;
+};
+
+uint64_t failures(const Spool& spool, SpoolFailure kind) {
+  return spool.figures().failed[static_cast<size_t>(kind)];
+}
+
+class SpoolTest : public ::testing::Test {
+ protected:
+  std::vector<std::string> filesWith(const std::string& part) const {
+    std::vector<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(directory_.path())) {
+      if (entry.path().filename().string().find(part) != std::string::npos)
+        names.push_back(entry.path().filename());
+    }
+    return names;
+  }
+
+  TemporaryDirectory directory_;
+  FakeClock clock_;
+  RecordingLog log_;
+};
+
+TEST_F(SpoolTest, RowsStandInSendOrderWithTimeNameAndPayloadAsJson) {
+  Spool spool(directory_.path("state"), clock_);
+  EXPECT_FALSE(std::filesystem::exists(directory_.path("state"))) << "nothing was sent yet";
+  Payload payload;
+  payload.set("Z", SharedString("first"));
+  payload.set("A", Number{0.1f});
+  payload.set("M", Number{true});
+  payload.set("Text", SharedString("a\xff\"b"));
+  EXPECT_TRUE(spool.sendEvent("com.vantor.performance.tessel", payload));
+  clock_.advance(std::chrono::microseconds{7});
+  EXPECT_TRUE(spool.sendEvent("ts__\xc3__", Payload{}));
+
+  Reader reader(directory_.path("state"));
+  EXPECT_THAT(reader.rows(),
+              ElementsAre("1795000000000000 com.vantor.performance.tessel "
+                          "{\"Z\":\"first\",\"A\":0.1,\"M\":true,\"Text\":\"a\xef\xbf\xbd\\\"b\"}",
+                          "1795000000000007 ts__\xef\xbf\xbd__ {}"));
+  EXPECT_EQ(reader.database().text("PRAGMA journal_mode"), "wal");
+  EXPECT_EQ(reader.database().integer("SELECT length(value) FROM meta WHERE key='spool_id'"), 32);
+  EXPECT_EQ(spool.figures().stored, 2u);
+  EXPECT_TRUE(log_.lines().empty());
+}
+
+TEST_F(SpoolTest, GoesOnWhereAnEarlierProcessEndedAndKeepsItsIdentifier) {
+  std::optional<std::string> id;
+  for (int64_t run = 1; run <= 3; ++run) {
+    Spool spool(directory_.path(), clock_);
+    EXPECT_TRUE(spool.sendEvent("a", numbered(run)));
+    Reader reader(directory_.path());
+    EXPECT_EQ(reader.count(), run);
+    const auto found = reader.database().text("SELECT value FROM meta WHERE key='spool_id'");
+    EXPECT_EQ(id.value_or(*found), *found);
+    id = found;
+  }
+}
+
+TEST_F(SpoolTest, AnotherSpoolTakesItsPlaceAfterTheRunWhereTheFirstWasRemoved) {
+  Spool spool(directory_.path(), clock_);
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  spool.endRun();
+  std::filesystem::remove(directory_.path(kSpoolFileName));
+  spool.beginRun();
+  EXPECT_EQ(spool.figures().stored, 0u);
+  EXPECT_TRUE(spool.sendEvent("a", numbered(2)));
+  EXPECT_EQ(Reader(directory_.path()).count(), 1);
+}
+
+TEST_F(SpoolTest, EverySendIsFlushedToTheDiskBeforeItReturns) {
+  Spool spool(directory_.path(), clock_);
+  ASSERT_TRUE(spool.sendEvent("a", numbered(0)));
+  for (int i = 1; i < 20; ++i) {
+    const uint64_t before = flushes;
+    ASSERT_TRUE(spool.sendEvent("a", numbered(i)));
+    EXPECT_GT(flushes, before);
+  }
+}
+
+TEST_F(SpoolTest, ALockHoldsTheQueueOnceAndIsSaidOnce) {
+  Spool spool(directory_.path(), clock_);
+  ASSERT_TRUE(spool.sendEvent("a", numbered(0)));
+  Reader other(directory_.path());
+  ASSERT_TRUE(other.database().execute("BEGIN IMMEDIATE").ok());
+  const auto start = std::chrono::steady_clock::now();
+  for (int i = 0; i < 200; ++i) EXPECT_FALSE(spool.sendEvent("a", numbered(i)));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(20))
+      << "waited more than once";
+  ASSERT_TRUE(other.database().execute("COMMIT").ok());
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  EXPECT_EQ(failures(spool, SpoolFailure::locked), 200u);
+  EXPECT_EQ(log_.lines().size(), 1u);
+  EXPECT_EQ(other.count(), 2);
+}
+
+TEST_F(SpoolTest, WhatCannotBeWrittenFailsForItsReasonAndIsLeftAlone) {
+  const std::string file = directory_.path(kSpoolFileName);
+  const struct {
+    const char* what;
+    std::function<void()> arrange;
+    SpoolFailure reason;
+  } cases[] = {
+      {"a directory in its place", [&] { std::filesystem::create_directory(file); },
+       SpoolFailure::readOnly},
+      {"a newer schema",
+       [&] {
+         SqliteDatabase newer;
+         ASSERT_TRUE(newer.open(file, SqliteDatabase::Mode::create).ok());
+         ASSERT_TRUE(newer.execute("PRAGMA user_version=99; CREATE TABLE later(x)").ok());
+       },
+       SpoolFailure::version},
+      {"another program's database",
+       [&] {
+         SqliteDatabase foreign;
+         ASSERT_TRUE(foreign.open(file, SqliteDatabase::Mode::create).ok());
+         ASSERT_TRUE(foreign.execute("CREATE TABLE events(something)").ok());
+       },
+       SpoolFailure::other},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    c.arrange();
+    log_.clear();
+    Spool spool(directory_.path(), clock_);
+    EXPECT_FALSE(spool.sendEvent("a", numbered(1)));
+    EXPECT_FALSE(spool.sendEvent("a", numbered(2)));
+    EXPECT_EQ(failures(spool, c.reason), 2u);
+    EXPECT_EQ(log_.lines().size(), 1u);
+    EXPECT_TRUE(filesWith("damaged").empty());
+    std::filesystem::remove_all(file);
+    EXPECT_TRUE(spool.sendEvent("a", numbered(3))) << "works again as soon as the cause is gone";
+    spool.endRun();
+    std::filesystem::remove_all(file);
+  }
+}
+
+TEST_F(SpoolTest, PastItsLimitNewEventsAreRefusedAndOldOnesStay) {
+  constexpr uint64_t kLimit = 1 << 20;
+  Spool spool(directory_.path(), clock_, kLimit);
+  uint64_t sent = 0;
+  while (spool.sendEvent("a", ofSize(10'000))) ASSERT_LT(++sent, 1000u);
+  EXPECT_FALSE(spool.sendEvent("a", ofSize(10'000)));
+  EXPECT_GT(sent, 80u) << "the limit is a size, not a handful";
+  EXPECT_EQ(failures(spool, SpoolFailure::limit), 2u);
+  EXPECT_EQ(spool.figures().failedInAll(), 2u);
+  EXPECT_EQ(log_.lines().size(), 1u);
+  spool.endRun();
+  EXPECT_LE(std::filesystem::file_size(directory_.path(kSpoolFileName)), kLimit);
+
+  Reader reader(directory_.path());
+  EXPECT_EQ(reader.count(), static_cast<int64_t>(sent));
+  ASSERT_TRUE(reader.database().execute("DELETE FROM events WHERE id <= 10").ok());
+  spool.beginRun();
+  EXPECT_TRUE(spool.sendEvent("a", ofSize(10'000))) << "space that was given back is used again";
+}
+
+TEST_F(SpoolTest, AReaderThatNeverEndsDoesNotMakeTheLogGrowWithoutEnd) {
+  constexpr uint64_t kLimit = 4 << 20;
+  Spool spool(directory_.path(), clock_, kLimit);
+  ASSERT_TRUE(spool.sendEvent("a", numbered(0)));
+  Reader other(directory_.path());
+  ASSERT_TRUE(other.database().execute("BEGIN; SELECT count(*) FROM events").ok());
+  for (int i = 0; i < 2000; ++i) spool.sendEvent("a", numbered(i));
+  EXPECT_GT(failures(spool, SpoolFailure::limit), 0u);
+  EXPECT_LE(std::filesystem::file_size(directory_.path("statora.db-wal")), kLimit / 8);
+  ASSERT_TRUE(other.database().execute("COMMIT").ok());
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+}
+
+TEST_F(SpoolTest, ADamagedSpoolIsSetAsideAsItIsAndANewOneBegun) {
+  const std::string damage(8192, '\x5a');
+  directory_.write(kSpoolFileName, damage);
+  directory_.write("statora.db-wal", "its log");
+  Spool spool(directory_.path(), clock_);
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  const std::string name = "statora.db.damaged-20261118T110640Z";
+  EXPECT_THAT(spool.figures().setAside, ElementsAre(name));
+  EXPECT_THAT(log_.lines(), ElementsAre(HasSubstr(name)));
+  EXPECT_EQ(std::filesystem::file_size(directory_.path(name)), damage.size());
+  EXPECT_EQ(std::filesystem::file_size(directory_.path(name + "-wal")), 7u);
+  EXPECT_EQ(Reader(directory_.path()).count(), 1);
+  spool.endRun();
+
+  directory_.write(kSpoolFileName, damage);
+  EXPECT_FALSE(spool.sendEvent("a", numbered(2))) << "one a run, however bad the disk";
+  EXPECT_EQ(failures(spool, SpoolFailure::damaged), 1u);
+  spool.beginRun();
+  EXPECT_TRUE(spool.sendEvent("a", numbered(3)));
+  EXPECT_THAT(spool.figures().setAside, ElementsAre(name + "-2"))
+      << "an older one is not overwritten";
+}
+
+TEST_F(SpoolTest, DamageThatIsMetInTheMiddleOfARunCostsNoStoredRow) {
+  Spool spool(directory_.path(), clock_);
+  for (int i = 0; i < 300; ++i) ASSERT_TRUE(spool.sendEvent("a", ofSize(500)));
+  spool.endRun();
+  // Everything but the first page: the schema is read, the tables are not.
+  const auto size = std::filesystem::file_size(directory_.path(kSpoolFileName));
+  {
+    std::fstream file(directory_.path(kSpoolFileName),
+                      std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(4096);
+    file << std::string(size - 4096, '\x5a');
+  }
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  ASSERT_EQ(spool.figures().setAside.size(), 1u);
+  EXPECT_EQ(std::filesystem::file_size(directory_.path(spool.figures().setAside[0])), size);
+  EXPECT_EQ(spool.figures().stored, 301u);
+}
+
+constexpr int kSkipped = 77;
+
+// In a child with a mount namespace of its own, in which `path` is a file system of 512 KiB.
+int sendUntilTheDiskIsFull(const std::string& path) {
+  if (unshare(CLONE_NEWNS) != 0 && unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) return kSkipped;
+  if (mount("tessel", path.c_str(), "tmpfs", 0, "size=512k") != 0) return kSkipped;
+  FakeClock clock;
+  RecordingLog log;
+  Spool spool(path, clock);
+  uint64_t sent = 0;
+  while (sent < 1000 && spool.sendEvent("a", ofSize(10'000))) ++sent;
+  if (sent == 0 || sent == 1000 || failures(spool, SpoolFailure::diskFull) != 1) return 1;
+  for (int i = 0; i < 20; ++i) spool.sendEvent("a", ofSize(10'000));
+  if (log.lines().size() != 1) return 2;
+  Reader reader(path);
+  return reader.integrity() == "ok" &&
+                 reader.count() == static_cast<int64_t>(spool.figures().stored)
+             ? 0
+             : 3;
+}
+
+TEST_F(SpoolTest, AFullDiskCostsTheNewEventsAlone) {
+  const pid_t child = fork();
+  if (child == 0) _exit(sendUntilTheDiskIsFull(directory_.path()));
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  if (WEXITSTATUS(status) == kSkipped) GTEST_SKIP() << "no mount namespace may be made here";
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+// Sends numbers from `first` on for ever and writes one byte for each send that returned.
+[[noreturn]] void sendForEver(const std::string& directory, int64_t first, int reports) {
+  FakeClock clock;
+  Spool spool(directory, clock);
+  for (int64_t number = first;; ++number) {
+    if (!spool.sendEvent("a", numbered(number)) || write(reports, "s", 1) != 1) _exit(1);
+  }
+}
+
+TEST_F(SpoolTest, AKillAtAnyMomentLosesNoRowWhoseSendWasFollowedByAnother) {
+  std::mt19937 random(1);  // the moments differ anyway
+  int64_t next = 0;        // every number below was sent for sure
+  for (int round = 0; round < 50; ++round) {
+    int pipes[2];
+    ASSERT_EQ(pipe2(pipes, O_CLOEXEC), 0);
+    const pid_t child = fork();
+    if (child == 0) sendForEver(directory_.path(), next, pipes[1]);
+    close(pipes[1]);
+    int64_t returned = 0;
+    char byte = 0;
+    for (const auto wanted = static_cast<int64_t>(random() % 40); returned < wanted; ++returned) {
+      ASSERT_EQ(read(pipes[0], &byte, 1), 1);
+    }
+    for (auto spin = random() % 20000; spin > 0; --spin) asm volatile("");
+    kill(child, SIGKILL);
+    ASSERT_EQ(waitpid(child, nullptr, 0), child);
+    while (read(pipes[0], &byte, 1) == 1) ++returned;
+    close(pipes[0]);
+    if (!std::filesystem::exists(directory_.path(kSpoolFileName))) continue;
+
+    SqliteDatabase database;
+    ASSERT_TRUE(openSpoolDatabase(database, directory_.path(kSpoolFileName), 1000).ok());
+    ASSERT_EQ(database.text("PRAGMA integrity_check"), "ok");
+    const int64_t stored = database.integer("SELECT count(*) FROM events").value_or(-1);
+    ASSERT_GE(stored, next + returned);
+    ASSERT_LE(stored, next + returned + 1);
+    ASSERT_EQ(
+        database.integer("SELECT count(DISTINCT json_extract(payload, '$.Number')) FROM events"),
+        stored);
+    next = stored;
+  }
+  EXPECT_GT(next, 100);
+}
+
+TEST_F(SpoolTest, AnEventCostsLessThanAMillisecondOfProcessorTime) {
+  Spool spool(directory_.path(), clock_);
+  const auto used = [] {
+    rusage usage{};
+    getrusage(RUSAGE_SELF, &usage);
+    return std::chrono::seconds(usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) +
+           std::chrono::microseconds(usage.ru_utime.tv_usec + usage.ru_stime.tv_usec);
+  };
+  ASSERT_TRUE(spool.sendEvent("a", ofSize(400)));
+  const auto before = used();
+  for (int i = 0; i < 500; ++i) ASSERT_TRUE(spool.sendEvent("a", ofSize(400)));
+  EXPECT_LT(used() - before, std::chrono::milliseconds(500));
+}
+
+}  // namespace
+}  // namespace tessel
