@@ -1,0 +1,44 @@
+// The arithmetic of pacing.
+
+#include "platform/Throttle.h"
+
+#include "platform/Log.h"
+
+namespace tessel {
+
+namespace {
+constexpr uint32_t eventsPerQuantum = 10;
+}
+
+void Throttle::setUp() {
+  const Timebase timebase = clock_.timebase();
+  microsecondsPerMachUnit_ =
+      static_cast<double>(timebase.numerator) / static_cast<double>(timebase.denominator) / 1000.0;
+  quantumMicroseconds_ = 125000.0f;
+  const double quantum = static_cast<double>(quantumMicroseconds_);
+  tesselReporterLog().debug("%f us, %f mach time units per quantum of %u reported events", quantum,
+                            quantum / microsecondsPerMachUnit_, eventsPerQuantum);
+  quantumStartTime_ = clock_.continuousTicks();
+}
+
+void Throttle::throttleReportedEvent() {
+  std::call_once(firstUse_, [this] { setUp(); });
+  ++eventsInQuantum_;
+  if (eventsInQuantum_ < eventsPerQuantum) return;
+  const uint64_t ticks = clock_.continuousTicks() - quantumStartTime_;
+  sleepForRestOfQuantum(static_cast<double>(ticks) * microsecondsPerMachUnit_);
+  eventsInQuantum_ = 0;
+  quantumStartTime_ = clock_.continuousTicks();
+}
+
+void Throttle::sleepForRestOfQuantum(double elapsedMicroseconds) {
+  const double quantum = static_cast<double>(quantumMicroseconds_);
+  if (!(elapsedMicroseconds < quantum)) return;
+  const auto sleep = static_cast<uint32_t>(quantum - elapsedMicroseconds);
+  tesselReporterLog().debug("Sleeping for %u us", sleep);
+  clock_.sleepMicroseconds(sleep);
+  throttledMicroseconds_ += sleep;
+  ++throttledCount_;
+}
+
+}  // namespace tessel

@@ -1,0 +1,29 @@
+// handleActivity: what the service does when its background activity changes state.
+
+#pragma once
+
+#include <memory>
+
+#include "platform/Activity.h"
+#include "platform/Runtime.h"
+#include "service/ReportingRun.h"
+
+namespace tessel {
+
+inline constexpr char kActivityName[] = "com.vantor.tessel.tessel_reporter_activity";
+
+class ActivityHandler {
+ public:
+  ActivityHandler(Runtime& runtime, ReportingRun& run) : runtime_(runtime), run_(run) {}
+
+  // Called by the scheduler on a thread of its own, never twice at a time. Blocks for a whole run.
+  void handleActivity(std::shared_ptr<Activity> activity);
+
+ private:
+  void runOrDefer(const std::shared_ptr<Activity>& activity);
+
+  Runtime& runtime_;
+  ReportingRun& run_;
+};
+
+}  // namespace tessel

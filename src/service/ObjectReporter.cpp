@@ -1,0 +1,45 @@
+// Filter, payload, pacing and the two sends of one object.
+
+#include "service/ObjectReporter.h"
+
+#include "platform/Log.h"
+
+namespace tessel {
+
+namespace {
+
+// The event named after the object. An object without a name has none.
+void sendNamedPayloadEvent(EventSender& sender, const TesselObject& object, const Payload& payload) {
+  if (!object.subsystem() || !object.category() || !object.name()) return;
+  std::string name = "ts__";
+  name.append(object.subsystem().text()).append("__");
+  name.append(object.category().text()).append("__");
+  name.append(object.name().text());
+  sender.sendEvent(name, payload);
+}
+
+}  // namespace
+
+bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject>& object) {
+  if (!filter_->shouldReportTesselObject(*object, nullptr)) return true;
+  std::optional<Payload> payload = object->statoraPayload(road_.identity);
+  if (!payload) {
+    tesselReporterLog().debug("Failed to create payload for %@/%@%@", object->subsystem(), object->category(),
+                              object->name());
+    return true;
+  }
+  payload->set("BootPartitionFS", bootFilesystem_);
+  payload->set("BootDiskType", bootDisk_);
+  send(object, std::make_shared<const Payload>(*std::move(payload)));
+  return true;
+}
+
+void ObjectReporter::send(const std::shared_ptr<const TesselObject>& object, std::shared_ptr<const Payload> payload) {
+  EventSender& sender = road_.sender;
+  road_.throttle.throttleReportedEvent();
+  road_.reportingQueue.async([&sender, payload] { sender.sendEvent("com.vantor.performance.tessel", *payload); });
+  road_.throttle.throttleReportedEvent();
+  road_.reportingQueue.async([&sender, object, payload] { sendNamedPayloadEvent(sender, *object, *payload); });
+}
+
+}  // namespace tessel

@@ -1,0 +1,107 @@
+// The gate's outcomes, each with its line in the log.
+
+#include <gtest/gtest.h>
+
+#include "platform/testing/Fakes.h"
+#include "tasking/TaskingGate.h"
+
+namespace tessel {
+namespace {
+
+using Dictionary = ConfigurationValue::Dictionary;
+constexpr char kType[] = "com.vantor.performance.tessel_reporter_tasking";
+
+std::shared_ptr<const ConfigurationValue> configuration(ConfigurationValue value) {
+  return std::make_shared<const ConfigurationValue>(std::move(value));
+}
+std::shared_ptr<const ConfigurationValue> taskedOn(ConfigurationValue value) {
+  return configuration({Dictionary{{"Other", {Number{false}}}, {"TaskedOn", std::move(value)}}});
+}
+
+class TaskingGateTest : public ::testing::Test {
+ protected:
+  // Delivers the configurations while the gate waits.
+  bool ask(std::vector<std::pair<std::shared_ptr<const ConfigurationValue>, std::string>> deliveries) {
+    clock.whileWaiting = [this, deliveries = std::move(deliveries)] {
+      for (const auto& [value, type] : deliveries) configurations.observers.back()->deliver(value, type);
+      queues.runAll();
+    };
+    return gate.shouldReport();
+  }
+
+  testing::RecordingLog log;
+  testing::FakeBuildVariant variant;
+  testing::FakeConfigurationService configurations;
+  testing::ManualQueueFactory queues;
+  testing::FakeClock clock;
+  TaskingGate gate{variant, configurations, queues, clock};
+};
+
+TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
+  variant.internal = true;
+  EXPECT_TRUE(gate.shouldReport());
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"Reporting based on os_flavor result"});
+  EXPECT_EQ(variant.lastSubsystem, "com.vantor.tessel");
+  EXPECT_TRUE(configurations.observers.empty());
+  EXPECT_TRUE(queues.queues.empty());
+}
+
+TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSeconds) {
+  EXPECT_FALSE(gate.shouldReport());
+  EXPECT_EQ(log.lines(),
+            std::vector<std::string>{
+                "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"});
+  EXPECT_EQ(clock.waits, std::vector<std::chrono::nanoseconds>{std::chrono::seconds{5}});
+  EXPECT_EQ(configurations.observers.at(0)->observed, std::vector<std::string>{kType});
+  EXPECT_EQ(configurations.observers.at(0)->queue->label(), "tessel_reporter configuration observing queue");
+}
+
+TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
+  const struct {
+    std::shared_ptr<const ConfigurationValue> value;
+    std::string type;
+    bool reports;
+    const char* line;
+  } cases[] = {
+      {taskedOn({Number{true}}), "com.vantor.other", false,
+       "Not reporting based on not being tasked-on by Statora (unexpected type string: 'com.vantor.other')"},
+      {nullptr, kType, false, "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
+      {configuration({ConfigurationValue::List{}}), kType, false,
+       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"},
+      {configuration({std::string("TaskedOn")}), kType, false,
+       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"},
+      {configuration({Dictionary{{"taskedOn", {Number{true}}}}}), kType, false,
+       "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"},
+      {taskedOn({std::string("true")}), kType, false,
+       "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"},
+      {taskedOn({Number{false}}), kType, false,
+       "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
+      {taskedOn({Number{int64_t{0}}}), kType, false,
+       "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
+      {taskedOn({Number{true}}), kType, true, "Reporting based on being tasked-on by Statora"},
+      {taskedOn({Number{int64_t{1}}}), kType, true, "Reporting based on being tasked-on by Statora"},
+  };
+  for (const auto& c : cases) {
+    log.clear();
+    EXPECT_EQ(ask({{c.value, c.type}}), c.reports) << c.line;
+    EXPECT_EQ(log.lines(), std::vector<std::string>{c.line});
+  }
+}
+
+TEST_F(TaskingGateTest, OfSeveralConfigurationsTheLastBeforeTheReadDecides) {
+  EXPECT_TRUE(ask({{nullptr, kType}, {taskedOn({Number{true}}), kType}}));
+  EXPECT_FALSE(ask({{taskedOn({Number{true}}), kType}, {taskedOn({Number{false}}), kType}}));
+}
+
+TEST_F(TaskingGateTest, AConfigurationAfterTheTimeoutIsLoggedAndTheNextCallAsksAfresh) {
+  EXPECT_FALSE(gate.shouldReport());
+  log.clear();
+  configurations.observers.at(0)->deliver(taskedOn({Number{true}}), kType);
+  queues.runAll();
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"Reporting based on being tasked-on by Statora"});
+  EXPECT_FALSE(gate.shouldReport());
+  EXPECT_EQ(configurations.observers.size(), 2u);
+}
+
+}  // namespace
+}  // namespace tessel
