@@ -1,0 +1,360 @@
+// A whole run over fakes: its order, its exits, the deferral, the books.
+
+#include <gtest/gtest.h>
+
+#include "objects/testing/TestObjects.h"
+#include "platform/testing/Fakes.h"
+#include "service/ActivityHandler.h"
+
+namespace tessel {
+namespace {
+
+using testing::TestPoint;
+
+struct RememberingObserver final : RunObserver {
+  void runReached(std::string_view step) override { steps.emplace_back(step); }
+  void objectDelivered() override { ++delivered; }
+  void runEnded(const RunReport& report) override { reports.push_back(report); }
+
+  std::vector<std::string> steps;
+  size_t delivered = 0;
+  std::vector<RunReport> reports;
+};
+
+class ReportingRunTest : public ::testing::Test {
+ protected:
+  ReportingRunTest() { variant.internal = true; }
+
+  std::shared_ptr<TesselSupportObjectExtractor> nextExtractor() {
+    log.write(LogLevel::debug, "", "", "(extractor made)");
+    return extractor;
+  }
+  void perform() { run.performReportingRun(activity); }
+  // The run's lines up to its first summary section, without those of filter and throttle.
+  std::vector<std::string> linesBeforeSummary() const {
+    std::vector<std::string> kept;
+    for (const std::string& line : log.lines()) {
+      if (line.starts_with("**************")) break;
+      kept.push_back(line);
+    }
+    return kept;
+  }
+
+  testing::RecordingLog log;
+  testing::FakeClock clock;
+  testing::ManualQueueFactory queues;
+  testing::ManualQueue reportingQueue{"reporting"};
+  testing::FakeBuildVariant variant;
+  testing::FakeConfigurationService configurations;
+  testing::FakeFiles files;
+  testing::FakeVolumes volumes;
+  testing::FakeBundles bundles;
+  testing::RememberingSender sender;
+  testing::FakeDates dates;
+  std::shared_ptr<testing::FakeExtractor> extractor = std::make_shared<testing::FakeExtractor>();
+  std::shared_ptr<testing::FakeActivity> activity = std::make_shared<testing::FakeActivity>();
+  RememberingObserver observer;
+
+  TaskingGate gate{variant, configurations, queues, clock};
+  CookieFile cookie{files};
+  Throttle throttle{clock};
+  ProcessIdentity identity{bundles};
+  RunSummary summary{sender, throttle, clock, dates};
+  const EventRoad road{identity, throttle, sender, reportingQueue};
+  ReportingRun run{gate,    cookie,   {queues, clock, volumes, variant}, [this] { return nextExtractor(); }, road,
+                   summary, observer};
+};
+
+TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
+  extractor->duringProcessing = [this] { EXPECT_TRUE(files.items.contains(cookieFilePath)); };
+  perform();
+  EXPECT_EQ(linesBeforeSummary(),
+            (std::vector<std::string>{"Reporting based on os_flavor result", "Created cookie file", "(extractor made)",
+                                      "Filesystem for '/': ext4", "Boot disk type: SSD"}));
+  EXPECT_EQ(log.lines().back(), "Cleared cookie file");
+  EXPECT_EQ(extractor->calls, (std::vector<std::string>{"interval callback", "animation callback", "event callback",
+                                                        "composite off", "process"}));
+  EXPECT_EQ(extractor->processedPath, std::nullopt);
+  EXPECT_EQ(extractor->endDate - extractor->startDate, std::chrono::hours{24});
+  EXPECT_EQ(extractor->endDate, clock.date);
+  EXPECT_FALSE(files.items.contains(cookieFilePath));
+  EXPECT_TRUE(activity->statesSet.empty());
+  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::completed);
+}
+
+TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsBeforeTheSummary) {
+  TestPoint point;
+  extractor->objects = {makeEvent(point), makeInterval(point), makeAnimationInterval(point)};
+  perform();
+  const std::vector<std::string> names = sender.names();
+  ASSERT_GE(names.size(), 7u);
+  for (size_t i = 0; i < 6; i += 2) {
+    EXPECT_EQ(names[i], "com.vantor.performance.tessel");
+    EXPECT_EQ(names[i + 1], "ts__com.vantor.Calendar__View__Open");
+    EXPECT_EQ(sender.events[i].json, sender.events[i + 1].json);
+  }
+  EXPECT_EQ(names[6], "com.vantor.performance.tessel_counts");
+  EXPECT_EQ(names.back(), "com.vantor.performance.tessel_reporting_stats");
+  EXPECT_EQ(sender.events[0].json,
+            R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open","IntervalType":"Event",)"
+            R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
+  EXPECT_EQ(observer.delivered, 3u);
+}
+
+TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
+  variant.internal = false;
+  files.items[cookieFilePath] = false;
+  perform();
+  EXPECT_TRUE(files.items.contains(cookieFilePath));
+  EXPECT_TRUE(extractor->calls.empty());
+  EXPECT_TRUE(sender.events.empty());
+  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::notTasked);
+}
+
+TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
+  files.items[cookieFilePath] = true;
+  perform();
+  EXPECT_EQ(log.lines(), (std::vector<std::string>{
+                             "Reporting based on os_flavor result", "Cookie file exists but is directory",
+                             "Bailing due to cookie file", "Cookie file exists but is directory", "Cleared cookie file"}));
+  EXPECT_TRUE(sender.events.empty());
+  perform();
+  EXPECT_EQ(sender.names().back(), "com.vantor.performance.tessel_reporting_stats");
+  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::bailedOut);
+  EXPECT_EQ(observer.reports.at(1).outcome, RunOutcome::completed);
+}
+
+TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
+  files.canCreate = false;
+  perform();
+  EXPECT_EQ(log.lines().back(), "Could not create cookie file");
+  EXPECT_TRUE(extractor->calls.empty());
+  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::noMarker);
+}
+
+TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
+  const struct {
+    RemovalResult removal;
+    const char* line;
+  } cases[] = {{{false, "Permission denied"}, "Could not clear cookie file: Permission denied"},
+               {{false, {}}, "Could not clear cookie file: Unknown error"}};
+  for (const auto& c : cases) {
+    log.clear();
+    files.items.clear();
+    files.removal = c.removal;
+    perform();
+    EXPECT_EQ(log.errors(), std::vector<std::string>{c.line});
+  }
+}
+
+TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
+  extractor->failure = PlatformError{"/store: no such directory"};
+  extractor->eventCount = 7;
+  perform();
+  EXPECT_EQ(log.count("Failed to process tessel data due to error: /store: no such directory"), 1u);
+  EXPECT_NE(sender.events.back().json.find("\"LogObjectsProcessed\":7"), std::string::npos);
+  EXPECT_FALSE(files.items.contains(cookieFilePath));
+  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::extractionFailed);
+}
+
+TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
+  for (const auto& type : {std::optional<std::string>(), std::optional<std::string>("\xff")}) {
+    volumes.type = type;
+    extractor->objects = {makeEvent({})};
+    sender.events.clear();
+    perform();
+    EXPECT_EQ(sender.events.at(0).json.find("BootPartitionFS"), std::string::npos);
+    EXPECT_NE(sender.events.at(0).json.find("\"BootDiskType\":\"SSD\""), std::string::npos);
+  }
+  EXPECT_EQ(log.count("Could not determine filesystem type"), 2u);
+}
+
+TEST_F(ReportingRunTest, AnObjectWithoutANameSendsTheFixedEventAlone) {
+  TestPoint point;
+  point.name.reset();
+  extractor->objects = {makeEvent(point)};
+  perform();
+  EXPECT_EQ(sender.names().at(0), "com.vantor.performance.tessel");
+  EXPECT_EQ(sender.names().at(1), "com.vantor.performance.tessel_counts");
+}
+
+TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
+  extractor->objects = {makeEvent({}), makeEvent({})};
+  activity->deferWanted = true;
+  extractor->beforeProcessing = [this] {
+    ASSERT_TRUE(queues.timers.back()->resumed);
+    queues.timers.back()->fire();
+    queues.runAll();
+  };
+  perform();
+  EXPECT_EQ(log.count("Trying to stop in-flight reporting work."), 1u);
+  EXPECT_EQ(log.count("Concluding processing due to deferral request"), 1u);
+  EXPECT_EQ(observer.delivered, 0u);
+  EXPECT_NE(sender.events.back().json.find("\"WasInterrupted\":true"), std::string::npos);
+  EXPECT_TRUE(activity->statesSet.empty());
+  EXPECT_TRUE(observer.reports.at(0).interruptedByDeferral);
+  const auto timer = queues.timers.back();
+  EXPECT_EQ(timer->interval, std::chrono::seconds{10});
+  EXPECT_EQ(timer->leeway, std::chrono::seconds{10});
+  EXPECT_EQ(timer->queue->label(), "tessel_reporter defer polling queue");
+}
+
+TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
+  perform();
+  observer.reports.clear();
+  const std::weak_ptr<testing::FakeExtractor> weak = extractor;
+  extractor.reset();
+  EXPECT_TRUE(weak.expired());
+  log.clear();
+  queues.timers.back()->fire();
+  activity->deferWanted = true;
+  queues.runAll();
+  EXPECT_EQ(log.lines(), (std::vector<std::string>{"Trying to stop in-flight reporting work.",
+                                                   "Concluding processing due to deferral request"}));
+  activity->deferWanted = false;
+  log.clear();
+  queues.timers.back()->fire();
+  queues.runAll();
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferral not requested, continuing."});
+}
+
+TEST_F(ReportingRunTest, FivePairsOfASectionAreSentAndTheRestOnlyCounted) {
+  for (int pair = 0; pair < 7; ++pair) {
+    TestPoint point;
+    point.category = "C" + std::to_string(pair);
+    point.telemetryEnabled = false;
+    for (int i = 0; i <= pair; ++i) extractor->objects.push_back(makeInterval(point));
+  }
+  perform();
+  std::vector<std::string> counts;
+  for (const auto& event : sender.events) {
+    if (event.name == "com.vantor.performance.tessel_counts") counts.push_back(event.json);
+  }
+  ASSERT_EQ(counts.size(), 5u);
+  EXPECT_EQ(counts[0],
+            R"({"Subsystem":"com.vantor.Calendar","Category":"C6","Count":7,"Classification":"AllInspected"})");
+  EXPECT_EQ(counts[4],
+            R"({"Subsystem":"com.vantor.Calendar","Category":"C2","Count":3,"Classification":"AllInspected"})");
+  EXPECT_EQ(log.count("com.vantor.Calendar/C2:\t3 (Count reported to Statora)"), 1u);
+  EXPECT_EQ(log.count("com.vantor.Calendar/C1:\t2 (Count not reported)"), 1u);
+  EXPECT_EQ(log.count("**************\nTotal tessel object count: 28"), 1u);
+  EXPECT_EQ(log.count("**************\nReported tessel object count: 0"), 1u);
+}
+
+TEST_F(ReportingRunTest, EachSectionStartsItsFiveAnew) {
+  variant.internal = true;
+  for (int pair = 0; pair < 6; ++pair) {
+    TestPoint point;
+    point.category = "C" + std::to_string(pair);
+    extractor->objects.push_back(makeEvent(point));
+    point.durationSeconds = -1;
+    extractor->objects.push_back(makeEvent(point));
+  }
+  perform();
+  std::map<std::string, int> perSection;
+  for (const auto& event : sender.events) {
+    const auto at = event.json.find("\"Classification\":");
+    if (at != std::string::npos) ++perSection[event.json.substr(at)];
+  }
+  EXPECT_EQ(perSection, (std::map<std::string, int>{{"\"Classification\":\"AllInspected\"}", 5},
+                                                    {"\"Classification\":\"Reported\"}", 5},
+                                                    {"\"Classification\":\"ReportedEvents\"}", 5},
+                                                    {"\"Classification\":\"DurationThresholdFiltered\"}", 5}}));
+}
+
+TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
+  TestPoint reported;
+  TestPoint disabled;
+  disabled.telemetryEnabled = false;
+  TestPoint negative;
+  negative.durationSeconds = -0.5f;
+  TestPoint capped;
+  capped.subsystem = "com.vantor.quellan.knowledge";
+  capped.category = "tessel";
+  capped.name = "Footprint";
+  extractor->objects = {makeEvent(reported),         makeEvent(reported),     makeInterval(reported),
+                        makeEvent(disabled),         makeInterval(disabled),  makeInterval(negative),
+                        makeAnimationInterval(capped), makeAnimationInterval(reported)};
+  extractor->eventCount = 99;
+  extractor->duringProcessing = [this] { clock.advance(std::chrono::milliseconds{1250}); };
+  perform();
+  EXPECT_EQ(sender.events.back().json,
+            R"({"ProcessingDurationInSeconds":1.25,"LogObjectsProcessed":99,"AnimationsReported":1,)"
+            R"("IntervalsReported":1,"EventsReported":2,"AnimationsNotReported":1,"IntervalsNotReported":2,)"
+            R"("EventsNotReported":1,"WasInterrupted":false})");
+  const std::string from = dates.format(extractor->startDate);
+  const std::string to = dates.format(extractor->endDate);
+  EXPECT_EQ(log.count("Done processing 2 reported and 1 unreported events, 1 reported and 2 unreported intervals and 1 "
+                      "reported and 1 unreported animations (1 blacklisted, 1 too short, 0 whitelisted, 2 telemetry not "
+                      "enabled) from 99 log events in 1.25s between " +
+                      from + " and " + to + "\n"),
+            1u);
+}
+
+TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
+  perform();
+  for (const std::string& line : log.lines()) EXPECT_FALSE(line.starts_with("Throttled ")) << line;
+  for (int i = 0; i < 5; ++i) extractor->objects.push_back(makeEvent({}));
+  perform();
+  ASSERT_EQ(throttle.throttledCount(), 1u);
+  const std::string line = "Throttled 1 times for a total of " + std::to_string(throttle.throttledMicroseconds()) + " usec";
+  EXPECT_EQ(log.count(line), 1u);
+  extractor->objects.clear();
+  perform();
+  EXPECT_EQ(log.count(line), 2u);
+}
+
+TEST_F(ReportingRunTest, EventsLeaveAlsoWhereNothingIsLogged) {
+  testing::RecordingLog quiet(LogLevel::error);
+  extractor->objects = {makeEvent({})};
+  perform();
+  EXPECT_EQ(sender.events.size(), 2u + 3u + 1u);
+  EXPECT_TRUE(quiet.lines().empty());
+}
+
+class ActivityHandlerTest : public ReportingRunTest {
+ protected:
+  void handle() { handler.handleActivity(activity); }
+
+  testing::FakeRuntime runtime;
+  ActivityHandler handler{runtime, run};
+  const std::vector<std::string> aroundEverything{
+      "open com.vantor.tessel.tessel_reporter_activity transaction", "clean exit", "close"};
+};
+
+TEST_F(ActivityHandlerTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransactionCloses) {
+  const struct {
+    int64_t state;
+    const char* line;
+  } cases[] = {{0, "Checking in\n"}, {1, "Unknown state 1\n"}, {3, "Unknown state 3\n"}, {-5, "Unknown state -5\n"}};
+  for (const auto& c : cases) {
+    log.clear();
+    runtime.calls.clear();
+    activity->currentState = c.state;
+    handle();
+    EXPECT_EQ(log.lines(), std::vector<std::string>{c.line});
+    EXPECT_EQ(runtime.calls, aroundEverything);
+  }
+  EXPECT_TRUE(observer.reports.empty());
+}
+
+TEST_F(ActivityHandlerTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
+  activity->deferWanted = true;
+  handle();
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferred tessel_reporter\n"});
+  EXPECT_EQ(activity->statesSet, std::vector<int64_t>{3});
+  EXPECT_EQ(runtime.calls, aroundEverything);
+  EXPECT_EQ(variant.asked, 0u);
+}
+
+TEST_F(ActivityHandlerTest, ADeferralThatIsNotTakenRunsAllTheSame) {
+  activity->deferWanted = true;
+  activity->takesStates = false;
+  handle();
+  EXPECT_EQ(observer.reports.size(), 1u);
+  EXPECT_EQ(log.count("Deferred tessel_reporter\n"), 0u);
+  EXPECT_EQ(runtime.calls, aroundEverything);
+}
+
+}  // namespace
+}  // namespace tessel
