@@ -1,0 +1,229 @@
+"""What the whole-service tests share: making stores, running the programs apart from the machine.
+
+The service's run marker has a fixed path under /var/tmp. Each Machine therefore gives the programs
+a /var/tmp of their own, by a mount namespace, so that tests neither meet each other nor a service
+that is installed here.
+"""
+import contextlib
+import json
+import os
+import shutil
+import signal
+import sqlite3
+import subprocess
+import sys
+import tempfile
+import time
+import unittest
+
+BIN = os.environ.get("TESSEL_BIN") or os.path.join(os.path.dirname(os.path.abspath(__file__)), "../build/dev/bin")
+SANITIZED = bool(os.environ.get("TESSEL_SANITIZE"))
+REMOTE = "/lib/systemd/systemd-journal-remote"
+SKIPPED = 77  # exit status that the test runner reads as "skipped"
+MARKER = "tessel_reporter_running"
+DEFAULT_BOOT = "5f2b1c0d9e8a47b6a1d2c3e4f5061728"
+TASKING = "com.vantor.performance.tessel_reporter_tasking.json"
+
+
+class Entry:
+    """One journal entry. `at` is in seconds relative to now, `mono` in microseconds since boot."""
+
+    def __init__(self, fields, at=-60.0, mono=None, boot=DEFAULT_BOOT, exe="/opt/Clock.AppDir/usr/bin/Clock",
+                 comm="Clock", pid=4711):
+        self.fields, self.at, self.boot, self.exe, self.comm, self.pid = list(fields), at, boot, exe, comm, pid
+        self.mono = mono if mono is not None else int((1_000_000 + at) * 1_000_000)
+
+    def realtime(self, now):
+        return int((now + self.at) * 1_000_000)
+
+
+def point(kind, subsystem, category, name=None, *, telemetry=True, string1=None, string2=None, number1=None,
+          number2=None, attributes=(), interval=None, scope=None, duration=None, frame_rate=None, **entry):
+    """A trace point as an Entry. Labelled values are (label, value) pairs; either may be None."""
+    fields = [("MESSAGE", "tessel"), ("TESSEL_KIND", kind), ("TESSEL_SUBSYSTEM", subsystem),
+              ("TESSEL_CATEGORY", category), ("TESSEL_NAME", name), ("TESSEL_INTERVAL_ID", interval),
+              ("TESSEL_INTERVAL_SCOPE", scope), ("TESSEL_TELEMETRY", "1" if telemetry else None),
+              ("TESSEL_DURATION", duration), ("TESSEL_FRAME_RATE", frame_rate)]
+    for slot, pair in (("STRING1", string1), ("STRING2", string2), ("NUMBER1", number1), ("NUMBER2", number2)):
+        if pair:
+            fields += [(f"TESSEL_{slot}_NAME", pair[0]), (f"TESSEL_{slot}_VALUE", pair[1])]
+    fields += [("TESSEL_ATTRIBUTE", f"{key}={value}") for key, value in attributes]
+    return Entry([(key, str(value)) for key, value in fields if value is not None], **entry)
+
+
+def log_event(text, **entry):
+    """An entry that is no trace point."""
+    return Entry([("MESSAGE", text), ("PRIORITY", "6")], **entry)
+
+
+def _field(name, value):
+    data = value if isinstance(value, bytes) else value.encode("utf-8", "surrogateescape")
+    if b"\n" in data or any(byte < 32 for byte in data):
+        return name.encode() + b"\n" + len(data).to_bytes(8, "little") + data + b"\n"
+    return name.encode() + b"=" + data + b"\n"
+
+
+def export_bytes(entries, now, first_sequence=1):
+    """The entries in the Journal Export Format."""
+    out = []
+    for number, entry in enumerate(entries, first_sequence):
+        realtime = entry.realtime(now)
+        cursor = f"s={'ab' * 16};i={number:x};b={entry.boot};m={entry.mono:x};t={realtime:x};x={number:x}"
+        head = [("__CURSOR", cursor), ("__REALTIME_TIMESTAMP", str(realtime)),
+                ("__MONOTONIC_TIMESTAMP", str(entry.mono)), ("_BOOT_ID", entry.boot)]
+        trusted = [("_EXE", entry.exe), ("_COMM", entry.comm), ("_PID", str(entry.pid) if entry.pid else None)]
+        fields = head + entry.fields + [pair for pair in trusted if pair[1] is not None]
+        out.append(b"".join(_field(key, value) for key, value in fields) + b"\n")
+    return b"".join(out)
+
+
+def have(program):
+    return shutil.which(program) or os.path.exists(program)
+
+
+def in_namespace_argv(var_tmp, command):
+    script = 'mount --bind "$0" /var/tmp && exec "$@"'
+    unshare = ["unshare", "--mount"] if os.geteuid() == 0 else ["unshare", "--user", "--map-root-user", "--mount"]
+    return unshare + ["--", "sh", "-c", script, var_tmp] + command
+
+
+class Machine:
+    """A trace store, a state and a configuration directory, and the programs run over them."""
+
+    def __init__(self):
+        self.root = tempfile.mkdtemp(prefix="tessel-test-")
+        self.store, self.state, self.config, self.var_tmp = (
+            os.path.join(self.root, name) for name in ("store", "state", "config", "var_tmp"))
+        for folder in (self.store, self.state, self.config, self.var_tmp):
+            os.mkdir(folder)
+        self.now = time.time()
+        self.os_release = os.path.join(self.root, "os-release")
+        self.set_internal(False)
+
+    def close(self):
+        shutil.rmtree(self.root, ignore_errors=True)
+
+    def set_internal(self, internal):
+        with open(self.os_release, "w", encoding="utf-8") as file:
+            file.write("ID=debian\n" + ("VARIANT_ID=internal\n" if internal else ""))
+
+    def task(self, text='{"TaskedOn": true}'):
+        path = os.path.join(self.config, TASKING)
+        with open(path + ".new", "w", encoding="utf-8") as file:
+            file.write(text)
+        os.rename(path + ".new", path)
+
+    def write_export(self, entries, name="a.export", **kwargs):
+        with open(os.path.join(self.store, name), "wb") as file:
+            file.write(export_bytes(entries, self.now, **kwargs))
+
+    def write_journal(self, entries, name="a.journal", environment=None, **kwargs):
+        """A journal file with the entries, made by systemd-journal-remote."""
+        if not os.path.exists(REMOTE):
+            print(f"skipped: {REMOTE} is not installed")
+            sys.exit(SKIPPED)
+        self.now = time.time()
+        export = os.path.join(self.root, name + ".source")
+        with open(export, "wb") as file:
+            file.write(export_bytes(entries, self.now, **kwargs))
+        path = os.path.join(self.store, name)
+        subprocess.run([REMOTE, "-o", path, export], check=True, capture_output=True,
+                       env={**os.environ, **(environment or {})})
+        os.unlink(export)
+        return path
+
+    def environment(self, **extra):
+        inherited = {key: value for key, value in os.environ.items() if not key.startswith(("TESSEL_", "LC_"))}
+        inherited.update(LANG="C.UTF-8", LC_ALL="en_US.UTF-8", TZ="UTC", TESSEL_TRACE_STORE=self.store, TESSEL_STATE_DIR=self.state,
+                         TESSEL_CONFIG_DIR=self.config, TESSEL_OS_RELEASE=self.os_release, TESSEL_DEFER_ON="file",
+                         TESSEL_LOG="stderr", TESSEL_LOG_LEVEL="debug")
+        inherited.update({key: value for key, value in extra.items() if value is not None})
+        for key, value in extra.items():
+            if value is None:
+                inherited.pop(key, None)
+        return inherited
+
+    def start(self, program="tessel_reporter", *arguments, **extra):
+        """Starts a program; what it prints goes to files that result() reads."""
+        command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments])
+        output = tempfile.TemporaryFile()
+        errors = tempfile.TemporaryFile()
+        process = subprocess.Popen(command, env=self.environment(**extra), stdout=output, stderr=errors,
+                                   stdin=subprocess.DEVNULL)
+        process.tessel_output, process.tessel_errors = output, errors
+        return process
+
+    def result(self, process, timeout=120):
+        process.wait(timeout)
+        return Result(process)
+
+    def run(self, **extra):
+        """One run of the service, from start to end."""
+        return self.result(self.start(**extra))
+
+    def ctl(self, *arguments, **extra):
+        return self.result(self.start("tesselctl", *arguments, **extra))
+
+    def marker_exists(self):
+        return os.path.lexists(os.path.join(self.var_tmp, MARKER))
+
+    def rows(self):
+        """(name, payload as a list of pairs) of each row of the spool, in order."""
+        path = os.path.join(self.state, "statora.db")
+        if not os.path.exists(path):
+            return []
+        with contextlib.closing(sqlite3.connect(path)) as database:
+            rows = database.execute("SELECT name, payload FROM events ORDER BY id").fetchall()
+        return [(name, json.loads(payload, object_pairs_hook=list)) for name, payload in rows]
+
+
+class Result:
+    def __init__(self, process):
+        self.status = process.returncode
+        self.out = self._read(process.tessel_output)
+        self.errors = self._read(process.tessel_errors)
+
+    @staticmethod
+    def _read(file):
+        file.seek(0)
+        return file.read().decode("utf-8", "surrogateescape")
+
+    @property
+    def log(self):
+        """The service's messages, each without its final line feed."""
+        messages = []
+        for line in self.errors.splitlines():
+            if line.startswith(("debug: ", "error: ")):
+                messages.append(line[len("debug: "):])
+            elif messages:
+                messages[-1] += "\n" + line.strip()
+        return messages
+
+
+class MachineTest(unittest.TestCase):
+    """A test case with a machine of its own, tasked on."""
+
+    def setUp(self):
+        self.machine = Machine()
+        self.machine.task()
+        self.addCleanup(self.machine.close)
+
+    def assert_clean(self, result):
+        self.assertEqual(result.status, 0, result.errors)
+
+
+def interrupt(process):
+    process.send_signal(signal.SIGINT)
+
+
+def main():
+    if not all(have(program) for program in ("unshare", "mount")):
+        print("skipped: unshare and mount are needed")
+        sys.exit(SKIPPED)
+    probe_dir = tempfile.mkdtemp()
+    probe = subprocess.run(in_namespace_argv(probe_dir, ["true"]), capture_output=True, text=True, check=False)
+    os.rmdir(probe_dir)
+    if probe.returncode != 0:
+        print("skipped: no mount namespace can be made here:", probe.stderr.strip())
+        sys.exit(SKIPPED)
+    unittest.main(verbosity=1)

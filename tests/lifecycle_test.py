@@ -1,0 +1,200 @@
+#!/usr/bin/env python3
+"""Life of the process: launch configuration, check-in, deferral, interrupt, crash, two at a time."""
+import json
+import os
+import random
+import signal
+import sqlite3
+import subprocess
+import time
+
+import harness
+from harness import MachineTest, interrupt, point
+
+STATISTICS = "com.vantor.performance.tessel_reporting_stats"
+
+
+def wait_for(condition, seconds=60):
+    deadline = time.monotonic() + seconds
+    while not condition():
+        if time.monotonic() > deadline:
+            raise AssertionError("timed out")
+        time.sleep(0.01)
+
+
+def some_points(count):
+    return [point("event", "com.vantor.Calendar", "View", f"Open{i}", at=-600 + i * 0.01) for i in range(count)]
+
+
+class Launch(MachineTest):
+    def test_a_value_that_makes_no_sense_is_one_line_and_status_78(self):
+        for variable, value in (("TESSEL_ACTIVITY_INTERVAL", "soon"), ("TESSEL_ACTIVITY_INTERVAL", "-1"),
+                                ("TESSEL_DEFER_RETRY", "15m"), ("TESSEL_DEFER_ON", "file,mood"),
+                                ("TESSEL_LOG", "paper"), ("TESSEL_LOG_LEVEL", "loud")):
+            os.rmdir(self.machine.state)
+            result = self.machine.run(**{variable: value})
+            self.assertEqual(result.status, 78, (variable, value))
+            lines = result.errors.splitlines()
+            self.assertEqual(len(lines), 1, lines)
+            self.assertIn(variable, lines[0])
+            self.assertIn(value, lines[0])
+            self.assertFalse(os.path.exists(self.machine.state), "nothing may be written")
+            os.mkdir(self.machine.state)
+
+    def test_arguments_are_ignored(self):
+        self.assert_clean(self.machine.result(self.machine.start("tessel_reporter", "--help", "x")))
+
+    def test_a_store_that_cannot_be_read_is_named_with_its_reason_and_the_books_are_closed(self):
+        absent = os.path.join(self.machine.root, "nowhere")
+        noise = os.path.join(self.machine.root, "noise.journal")
+        with open(noise, "wb") as file:
+            file.write(random.Random(1).randbytes(1 << 20))
+        for path in (absent, noise):
+            result = self.machine.run(TESSEL_TRACE_STORE=path)
+            self.assert_clean(result)
+            failures = [line for line in result.log if line.startswith("Failed to process tessel data due to error: ")]
+            self.assertEqual(len(failures), 1, result.log)
+            self.assertIn(path, failures[0])
+            self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
+            self.assertFalse(self.machine.marker_exists())
+
+    def test_a_damaged_file_among_good_ones_costs_that_file_alone(self):
+        self.machine.write_journal(some_points(3))
+        with open(os.path.join(self.machine.store, "b.journal"), "wb") as file:
+            file.write(b"LPKSHHRH" + random.Random(2).randbytes(1 << 16))
+        result = self.machine.run()
+        self.assert_clean(result)
+        self.assertEqual(dict(self.machine.rows()[-1][1])["EventsReported"], 3)
+        self.assertTrue(any("b.journal" in line for line in result.log), result.log)
+
+    def test_a_journal_cut_in_the_middle_yields_what_is_left(self):
+        path = self.machine.write_journal(some_points(2000))
+        os.truncate(path, os.path.getsize(path) * 2 // 3)
+        result = self.machine.ctl("explain", "--summary", "--json")
+        self.assertEqual(result.status, 0, result.errors)
+        figures = json.loads(result.out)
+        self.assertGreater(figures["trace_objects"], 1000)
+        self.assertLess(figures["trace_objects"], 2000)
+
+
+class Malformed(MachineTest):
+    def test_entries_with_a_required_field_missing_are_skipped_and_the_rest_delivered(self):
+        good = some_points(2)
+        entries = [good[0]]
+        for missing in ("TESSEL_KIND", "TESSEL_SUBSYSTEM", "TESSEL_CATEGORY"):
+            entry = point("event", "com.vantor.Broken", "C", "N", at=-590)
+            entry.fields = [field for field in entry.fields if field[0] != missing]
+            entries.append(entry)
+        odd = point("happening", "com.vantor.Broken", "C", "N", at=-589)
+        entries += [odd, good[1]]
+        self.machine.write_journal(entries)
+        result = self.machine.run()
+        self.assert_clean(result)
+        statistics = dict(self.machine.rows()[-1][1])
+        self.assertEqual(statistics["EventsReported"], 2)
+        self.assertEqual(statistics["EventsNotReported"], 0)
+        self.assertEqual(statistics["LogObjectsProcessed"], len(entries))
+
+
+class Deferral(MachineTest):
+    def test_a_run_that_should_defer_is_offered_again(self):
+        self.machine.write_export(some_points(1))
+        wish = os.path.join(self.machine.state, "defer")
+        open(wish, "w", encoding="utf-8").close()
+        process = self.machine.start(TESSEL_DEFER_RETRY="1")
+        time.sleep(2.5)
+        self.assertIsNone(process.poll())
+        os.unlink(wish)
+        result = self.machine.result(process)
+        self.assert_clean(result)
+        self.assertEqual(result.log[:2], ["Checking in", "Deferred tessel_reporter"])
+        self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
+
+    def test_a_deferral_in_the_middle_stops_the_run_and_is_said(self):
+        self.machine.write_export(some_points(3000))
+        process = self.machine.start()
+        wait_for(lambda: self.machine.rows())
+        open(os.path.join(self.machine.state, "defer"), "w", encoding="utf-8").close()
+        result = self.machine.result(process)
+        self.assert_clean(result)
+        statistics = dict(self.machine.rows()[-1][1])
+        self.assertTrue(statistics["WasInterrupted"])
+        self.assertLess(statistics["EventsReported"], 3000)
+        self.assertTrue(any(line.endswith(" (Interrupted by deferral)") for line in result.log))
+        self.assertFalse(self.machine.marker_exists())
+
+
+class TwoProcesses(MachineTest):
+    def test_the_second_is_given_the_run_when_the_first_is_done(self):
+        self.machine.write_export(some_points(60))
+        first = self.machine.start()
+        wait_for(self.machine.marker_exists)
+        second = self.machine.start()
+        results = [self.machine.result(process) for process in (first, second)]
+        for result in results:
+            self.assert_clean(result)
+            self.assertNotIn("Bailing due to cookie file", result.log)
+        names = [name for name, _ in self.machine.rows()]
+        ends = [position for position, name in enumerate(names) if name == STATISTICS]
+        self.assertEqual(len(ends), 2)
+        self.assertEqual(ends[0], len(names) // 2 - 1, "the runs must not mix")
+
+    def test_a_process_that_stays_runs_again_when_its_interval_has_passed(self):
+        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1")
+        wait_for(lambda: [name for name, _ in self.machine.rows()].count(STATISTICS) >= 3)
+        interrupt(process)
+        self.assert_clean(self.machine.result(process))
+
+
+class Interrupt(MachineTest):
+    def test_it_ends_with_0_at_once_whatever_is_going_on(self):
+        self.machine.write_export(some_points(400))
+        slack = 2.0 if harness.SANITIZED else 1.0
+        for attempt in range(10):
+            process = self.machine.start()
+            time.sleep(0.05 + random.Random(attempt).random() * 1.5)
+            before = time.monotonic()
+            interrupt(process)
+            result = self.machine.result(process)
+            self.assertIn(result.status, (0, -signal.SIGINT if attempt == 0 else 0), result.errors)
+            self.assertLess(time.monotonic() - before, slack)
+
+
+class Crash(MachineTest):
+    def test_the_run_after_a_crash_bails_out_and_the_one_after_reports(self):
+        self.machine.write_export(some_points(400))
+        for attempt in range(3):
+            already = len(self.machine.rows())
+            process = self.machine.start()
+            wait_for(lambda: len(self.machine.rows()) > already + 3)
+            process.kill()
+            process.wait()
+            kept = self.machine.rows()
+            self.assertTrue(self.machine.marker_exists())
+            bailing = self.machine.run()
+            self.assert_clean(bailing)
+            self.assertIn("Bailing due to cookie file", bailing.log)
+            self.assertEqual(self.machine.rows(), kept)
+            self.assertFalse(self.machine.marker_exists())
+        check = subprocess.run(["sqlite3", os.path.join(self.machine.state, "statora.db"), "PRAGMA integrity_check"],
+                               check=True, capture_output=True, text=True)
+        self.assertEqual(check.stdout.strip(), "ok")
+        self.machine.write_export(some_points(1))
+        self.assert_clean(self.machine.run())
+        self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
+
+
+class Pacing(MachineTest):
+    def test_no_ten_sends_are_closer_than_a_quantum(self):
+        self.machine.write_export(some_points(100))
+        process = self.machine.start()
+        self.assert_clean(self.machine.result(process))
+        with sqlite3.connect(os.path.join(self.machine.state, "statora.db")) as database:
+            times = [row[0] for row in database.execute("SELECT time FROM events ORDER BY id")]
+        # The sends are queued at a paced moment and run soon after; the start of each ten is what is paced.
+        span = times[199] - times[9]
+        self.assertGreater(span, 125_000 * 18, "19 quanta of ten sends")
+
+
+if __name__ == "__main__":
+    harness.main()

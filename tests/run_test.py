@@ -1,0 +1,145 @@
+#!/usr/bin/env python3
+"""Whole runs over a real journal: every row of the spool and every line of the log."""
+import re
+import subprocess
+
+import harness
+from harness import MachineTest
+from mixed_day import mixed_day
+from model import DISABLED, DURATION, REPORTED, Rules, Run
+
+OUR_OWN_LINES = re.compile(r"^(Deferral not requested, continuing\.|Sleeping for \d+ us)$")
+
+
+def root_filesystem():
+    return subprocess.run(["findmnt", "-n", "-o", "FSTYPE", "/"], check=True, capture_output=True,
+                          text=True).stdout.split()[-1]
+
+
+def normal(line):
+    line = re.sub(r" in \d+\.\d\ds between .*? and [^(]*?(?=( \(Interrupted|$))", " in Ns between DATE and DATE", line)
+    return re.sub(r"^Throttled \d+ times for a total of \d+ usec$", "Throttled", line)
+
+
+class MixedDay(MachineTest):
+    def setUp(self):
+        super().setUp()
+        self.entries, self.bundles = mixed_day(self.machine)
+        self.filesystem = root_filesystem()
+
+    def expected(self, **rules):
+        return Run(self.entries, Rules(**rules), self.bundles, self.filesystem)
+
+    def assert_rows(self, expected):
+        rows = self.machine.rows()
+        name, statistics = rows[-1]
+        self.assertEqual(rows[:-1], expected.object_rows + expected.count_rows())
+        self.assertEqual(name, "com.vantor.performance.tessel_reporting_stats")
+        self.assertEqual(statistics[0][0], "ProcessingDurationInSeconds")
+        self.assertEqual(statistics[1:], expected.statistics())
+
+    def object_log(self, expected):
+        """The lines that deciding and sending write, object by object."""
+        lines, set_built, throttled, found = [], False, False, set()
+        for thing, verdict in expected.judged:
+            if verdict in (DISABLED, DURATION):
+                continue
+            lines.append("Defaulting to using string whitelist")
+            if not set_built and (thing.get("STRING1_NAME") or thing.get("STRING2_NAME")):
+                lines.append("Using string whitelist with 327 elements for Selvin platform")
+                set_built = True
+            if verdict != REPORTED:
+                continue
+            override = thing.attributes.get("BundleIdOverride")
+            overridden = thing.kind != "Event" and override and (
+                thing.pair[0] == "com.vantor.morvald" or thing.pair == ("com.vantor.Harrowmere", "Snapshot"))
+            if overridden:
+                lines.append("{}/{}/{}: Overriding bundle ID to {}".format(*thing.path, override))
+            else:
+                for entry in dict.fromkeys((thing.begin, thing.end)):
+                    if entry.exe in self.bundles and entry.exe not in found:
+                        found.add(entry.exe)
+                        lines.append(f'Found bundle ID: "{self.bundles[entry.exe]}" for path:"{entry.exe}"')
+            if not throttled:
+                throttled = True
+                lines.append("125000.000000 us, 125000000.000000 mach time units per quantum of 10 reported events")
+        return lines
+
+    def test_spool_and_log_are_what_the_recorded_points_must_yield(self):
+        self.machine.write_journal(self.entries)
+        result = self.machine.run()
+        self.assert_clean(result)
+        expected = self.expected()
+        self.assert_rows(expected)
+        self.assertFalse(self.machine.marker_exists())
+        wanted = (["Checking in", "Reporting based on being tasked-on by Statora", "Created cookie file",
+                   f"Filesystem for '/': {self.filesystem}", "Boot disk type: SSD"] +
+                  self.object_log(expected) + expected.summary_log() +
+                  [expected.closing_line("N"), "Throttled", "Cleared cookie file"])
+        got = [normal(line) for line in result.log if not OUR_OWN_LINES.match(line)]
+        self.assertEqual(got, wanted)
+        self.assertIn("Deferral not requested, continuing.", result.log)
+        sleeps = [int(line.split()[2]) for line in result.log if line.startswith("Sleeping for")]
+        throttled = [line for line in result.log if line.startswith("Throttled")]
+        self.assertEqual(throttled, [f"Throttled {len(sleeps)} times for a total of {sum(sleeps)} usec"])
+
+    def test_an_internal_build_needs_no_tasking_and_no_whitelist(self):
+        self.machine.set_internal(True)
+        self.machine.task('{"TaskedOn": false}')
+        self.machine.write_journal(self.entries)
+        result = self.machine.run()
+        self.assert_clean(result)
+        self.assert_rows(self.expected(internal=True))
+        self.assertIn("Reporting based on os_flavor result", result.log)
+
+    def test_the_log_level_changes_nothing_that_is_sent(self):
+        self.machine.write_export(self.entries)
+        result = self.machine.run(TESSEL_LOG_LEVEL="error")
+        self.assert_clean(result)
+        self.assertEqual(result.log, [])
+        self.assert_rows(self.expected())
+
+    def test_entries_outside_the_last_day_are_not_read(self):
+        early = [harness.point("event", "com.vantor.Old", "C", "N", at=-86400 - 3600 + i) for i in range(5)]
+        late = [harness.point("event", "com.vantor.Future", "C", "N", at=3600 + i) for i in range(5)]
+        self.machine.write_journal(early + self.entries + late)
+        self.assert_clean(self.machine.run())
+        self.assert_rows(self.expected())
+
+    def test_several_files_in_the_journals_own_order(self):
+        third = len(self.entries) // 3
+        for number in range(3):
+            part = self.entries[number * third:(number + 1) * third if number < 2 else None]
+            self.machine.write_export(part, f"{number}.export", first_sequence=1 + number * third)
+        self.assert_clean(self.machine.run())
+        self.assert_rows(self.expected())
+
+
+class NotTasked(MachineTest):
+    def test_without_a_configuration_it_waits_sends_nothing_and_leaves_nothing(self):
+        self.machine = harness.Machine()
+        self.addCleanup(self.machine.close)
+        self.machine.write_export([harness.point("event", "com.vantor.Calendar", "View", "Open")])
+        result = self.machine.run()
+        self.assert_clean(result)
+        self.assertEqual(result.log, ["Checking in",
+                                      "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"])
+        self.assertEqual(self.machine.rows(), [])
+        self.assertFalse(self.machine.marker_exists())
+
+    def test_every_configuration_that_is_no_yes_is_a_no(self):
+        nil = "Not reporting based on not being tasked-on by Statora (nil configuration object)"
+        for text, line in (("{", nil), ("{}", "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"),
+                           ("[1]", "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"),
+                           ('{"TaskedOn": "true"}', "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"),
+                           ('{"TaskedOn": 0}', "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"),
+                           ("[" * 100000, nil), ('{"TaskedOn": true, "x": "' + "y" * (1 << 20) + '"}', nil)):
+            self.machine.task(text)
+            result = self.machine.run()
+            self.assert_clean(result)
+            self.assertEqual(result.log, ["Checking in", line], text[:40])
+            self.assertEqual(self.machine.rows(), [])
+
+
+if __name__ == "__main__":
+    harness.main()
