@@ -4,11 +4,14 @@
 
 #include "objects/testing/TestObjects.h"
 #include "platform/testing/Fakes.h"
-#include "service/ActivityHandler.h"
+#include "service/ReporterActivity.h"
 
 namespace tessel {
 namespace {
 
+using testing::makeAnimationInterval;
+using testing::makeEvent;
+using testing::makeInterval;
 using testing::TestPoint;
 
 struct RememberingObserver final : RunObserver {
@@ -160,7 +163,7 @@ TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
 TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
   for (const auto& type : {std::optional<std::string>(), std::optional<std::string>("\xff")}) {
     volumes.type = type;
-    extractor->objects = {makeEvent({})};
+    extractor->objects = {makeEvent(TestPoint{})};
     sender.events.clear();
     perform();
     EXPECT_EQ(sender.events.at(0).json.find("BootPartitionFS"), std::string::npos);
@@ -179,7 +182,7 @@ TEST_F(ReportingRunTest, AnObjectWithoutANameSendsTheFixedEventAlone) {
 }
 
 TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
-  extractor->objects = {makeEvent({}), makeEvent({})};
+  extractor->objects = {makeEvent(TestPoint{}), makeEvent(TestPoint{})};
   activity->deferWanted = true;
   extractor->beforeProcessing = [this] {
     ASSERT_TRUE(queues.timers.back()->resumed);
@@ -294,7 +297,7 @@ TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
 TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
   perform();
   for (const std::string& line : log.lines()) EXPECT_FALSE(line.starts_with("Throttled ")) << line;
-  for (int i = 0; i < 5; ++i) extractor->objects.push_back(makeEvent({}));
+  for (int i = 0; i < 5; ++i) extractor->objects.push_back(makeEvent(TestPoint{}));
   perform();
   ASSERT_EQ(throttle.throttledCount(), 1u);
   const std::string line = "Throttled 1 times for a total of " + std::to_string(throttle.throttledMicroseconds()) + " usec";
@@ -306,23 +309,23 @@ TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
 
 TEST_F(ReportingRunTest, EventsLeaveAlsoWhereNothingIsLogged) {
   testing::RecordingLog quiet(LogLevel::error);
-  extractor->objects = {makeEvent({})};
+  extractor->objects = {makeEvent(TestPoint{})};
   perform();
   EXPECT_EQ(sender.events.size(), 2u + 3u + 1u);
   EXPECT_TRUE(quiet.lines().empty());
 }
 
-class ActivityHandlerTest : public ReportingRunTest {
+class ReporterActivityTest : public ReportingRunTest {
  protected:
   void handle() { handler.handleActivity(activity); }
 
   testing::FakeRuntime runtime;
-  ActivityHandler handler{runtime, run};
+  ReporterActivity handler{runtime, run};
   const std::vector<std::string> aroundEverything{
       "open com.vantor.tessel.tessel_reporter_activity transaction", "clean exit", "close"};
 };
 
-TEST_F(ActivityHandlerTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransactionCloses) {
+TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransactionCloses) {
   const struct {
     int64_t state;
     const char* line;
@@ -338,7 +341,7 @@ TEST_F(ActivityHandlerTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransa
   EXPECT_TRUE(observer.reports.empty());
 }
 
-TEST_F(ActivityHandlerTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
+TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
   activity->deferWanted = true;
   handle();
   EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferred tessel_reporter\n"});
@@ -347,7 +350,7 @@ TEST_F(ActivityHandlerTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
   EXPECT_EQ(variant.asked, 0u);
 }
 
-TEST_F(ActivityHandlerTest, ADeferralThatIsNotTakenRunsAllTheSame) {
+TEST_F(ReporterActivityTest, ADeferralThatIsNotTakenRunsAllTheSame) {
   activity->deferWanted = true;
   activity->takesStates = false;
   handle();

@@ -81,8 +81,8 @@ void RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
     const TesselReporterAggregation& aggregation = (filter.*section.aggregation)();
     tesselReporterLog().debug(section.header, aggregation.totalCount());
     counts.beginSection();
-    for (const TesselReporterAggregationKey& key : aggregation.keysInDescendingCountOrder()) {
-      counts.reportCountForKey(key, aggregation, section.classification);
+    for (const TesselReporterAggregationKey* key : aggregation.keysInDescendingCountOrder()) {
+      counts.reportCountForKey(*key, aggregation, section.classification);
     }
   }
 }

@@ -1,6 +1,6 @@
 // Check-in, run and defer.
 
-#include "service/ActivityHandler.h"
+#include "service/ReporterActivity.h"
 
 #include "platform/Log.h"
 
@@ -10,7 +10,7 @@ namespace {
 constexpr char kTransactionName[] = "com.vantor.tessel.tessel_reporter_activity transaction";
 }
 
-void ActivityHandler::handleActivity(std::shared_ptr<Activity> activity) {
+void ReporterActivity::handleActivity(std::shared_ptr<Activity> activity) {
   const auto transaction = runtime_.openTransaction(kTransactionName);
   const int64_t state = activity->state();
   if (state == kActivityStateRun) {
@@ -23,7 +23,7 @@ void ActivityHandler::handleActivity(std::shared_ptr<Activity> activity) {
   runtime_.requestCleanExit();
 }
 
-void ActivityHandler::runOrDefer(const std::shared_ptr<Activity>& activity) {
+void ReporterActivity::runOrDefer(const std::shared_ptr<Activity>& activity) {
   if (activity->shouldDefer() && activity->setState(kActivityStateDefer)) {
     tesselReporterLog().debug("Deferred tessel_reporter\n");
     return;

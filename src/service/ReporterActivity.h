@@ -12,9 +12,9 @@ namespace tessel {
 
 inline constexpr char kActivityName[] = "com.vantor.tessel.tessel_reporter_activity";
 
-class ActivityHandler {
+class ReporterActivity {
  public:
-  ActivityHandler(Runtime& runtime, ReportingRun& run) : runtime_(runtime), run_(run) {}
+  ReporterActivity(Runtime& runtime, ReportingRun& run) : runtime_(runtime), run_(run) {}
 
   // Called by the scheduler on a thread of its own, never twice at a time. Blocks for a whole run.
   void handleActivity(std::shared_ptr<Activity> activity);
