@@ -1,0 +1,16 @@
+// Replacing a small file as a whole.
+
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace tessel {
+
+// Makes `path` hold `text`: whoever opens it, at any time and past a power cut, finds all of the
+// old text or all of the new. Writes to `<path>.new` first, which no two callers may do at a time.
+// The reason in words where that fails; the old file then still stands.
+std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text);
+
+}  // namespace tessel

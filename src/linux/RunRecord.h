@@ -1,0 +1,59 @@
+// RunRecord: what a run came to, kept for whoever asks later.
+//
+// The service writes it at the end of a run that got past the tasking gate, as
+// `<state>/last_run.json`; each run replaces the record of the one before. A run that died leaves
+// none, so that the record is older than the scheduler's note of the last run then.
+
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Clock.h"
+
+namespace tessel {
+
+// completed: all of the range was read; interrupted: a deferral ended it early; bailedOut: the
+// marker of a run that died stood there; failed: the trace store could not be read.
+enum class RunOutcome { completed, interrupted, bailedOut, failed };
+
+// "completed", "interrupted", "bailed_out", "failed".
+const char* runOutcomeName(RunOutcome outcome);
+
+struct RunRecord {
+  using Named = std::vector<std::pair<std::string, uint64_t>>;
+  static constexpr size_t kClassifications = 6;
+  static constexpr size_t kReported = 1;  // the classification code of what was reported
+
+  Date start{};
+  Date end{};
+  RunOutcome outcome = RunOutcome::completed;
+  std::string failure;     // why it failed, in words; empty where it did not
+  uint64_t logEvents = 0;  // entries read, trace points or not
+  uint64_t inspected = 0;  // trace objects
+  std::array<uint64_t, kClassifications> classified{};  // trace objects by classification code
+  uint64_t countEvents = 0;                             // sent or tried
+  uint64_t rowsStored = 0;                              // in the spool
+  Named rowsFailed;                   // by reason; kept without those that are zero
+  std::vector<std::string> setAside;  // damaged spools, by file name
+  Named store;                        // facts about the trace store, by name, in order
+  std::string marker;                 // what became of the run marker, in words
+
+  // Whether every inspected object has exactly one classification.
+  bool objectsBalance() const;
+  // Whether the spool has what the run sent: two rows an object reported, the counts, the summary.
+  bool rowsBalance() const;
+
+  // The reason in words where the record cannot be written.
+  std::optional<std::string> write(const std::string& stateDirectory) const;
+  // Nothing where there is no record or it cannot be understood.
+  static std::optional<RunRecord> read(const std::string& stateDirectory);
+
+  bool operator==(const RunRecord&) const = default;
+};
+
+}  // namespace tessel
