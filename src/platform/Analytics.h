@@ -35,9 +35,9 @@ class ConfigurationObserverDelegate {
  public:
   virtual ~ConfigurationObserverDelegate() = default;
   // `configuration` is null where it is absent.
-  virtual void observerDidChangeConfiguration(ConfigurationObserver& observer,
-                                              const std::shared_ptr<const ConfigurationValue>& configuration,
-                                              const std::string& type) = 0;
+  virtual void observerDidChangeConfiguration(
+      ConfigurationObserver& observer,
+      const std::shared_ptr<const ConfigurationValue>& configuration, const std::string& type) = 0;
 };
 
 // Calls its delegate on its queue, at any time after observing began, any number of times. It

@@ -45,7 +45,8 @@ class LogHandle {
   }
   template <typename... Args>
   void error(LogFormat<std::type_identity_t<Args>...> format, const Args&... args) const {
-    if (isEnabled(LogLevel::error)) write(LogLevel::error, formatLog(format.text(), LogArgument(args)...));
+    if (isEnabled(LogLevel::error))
+      write(LogLevel::error, formatLog(format.text(), LogArgument(args)...));
   }
 
  private:

@@ -23,7 +23,8 @@ void LogArgument::appendTo(std::string& out, std::string_view conversion) const 
   }
 }
 
-std::string formatLogArguments(std::string_view text, std::initializer_list<LogArgument> arguments) {
+std::string formatLogArguments(std::string_view text,
+                               std::initializer_list<LogArgument> arguments) {
   std::string out;
   auto argument = arguments.begin();
   size_t from = 0;

@@ -32,12 +32,14 @@ consteval LogArgumentKind kindOf() {
     return LogArgumentKind::floating;
   } else if constexpr (std::is_integral_v<Plain>) {
     if constexpr (std::is_unsigned_v<Plain>) {
-      return sizeof(Plain) == 8 ? LogArgumentKind::unsigned64
-                                : sizeof(Plain) == 4 ? LogArgumentKind::unsigned32 : LogArgumentKind::none;
+      return sizeof(Plain) == 8   ? LogArgumentKind::unsigned64
+             : sizeof(Plain) == 4 ? LogArgumentKind::unsigned32
+                                  : LogArgumentKind::none;
     } else {
       return sizeof(Plain) == 8 ? LogArgumentKind::signed64 : LogArgumentKind::none;
     }
-  } else if constexpr (Described<Plain> || std::is_same_v<Plain, StringRef> || std::is_same_v<Plain, SharedString> ||
+  } else if constexpr (Described<Plain> || std::is_same_v<Plain, StringRef> ||
+                       std::is_same_v<Plain, SharedString> ||
                        std::is_convertible_v<const Plain&, std::string_view>) {
     return LogArgumentKind::text;
   } else {
@@ -74,7 +76,8 @@ class LogFormat {
  public:
   template <size_t N>
   consteval LogFormat(const char (&text)[N]) : text_(text, N - 1) {
-    constexpr detail::LogArgumentKind kinds[] = {detail::kindOf<Args>()..., detail::LogArgumentKind::none};
+    constexpr detail::LogArgumentKind kinds[] = {detail::kindOf<Args>()...,
+                                                 detail::LogArgumentKind::none};
     size_t used = 0;
     for (size_t at = text_.find('%'); at != std::string_view::npos; at = text_.find('%', at)) {
       const detail::LogConversion conversion = detail::conversionAt(text_.substr(at));

@@ -29,7 +29,8 @@ class Runtime {
   virtual std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) = 0;
   // Lets the process end with status 0 once no transaction is open and no delivery is pending.
   virtual void requestCleanExit() = 0;
-  virtual std::shared_ptr<SignalSource> makeSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue) = 0;
+  virtual std::shared_ptr<SignalSource> makeSignalSource(int signalNumber,
+                                                         std::shared_ptr<SerialQueue> queue) = 0;
   [[noreturn]] virtual void runMainLoop() = 0;
 };
 

@@ -40,7 +40,8 @@ class QueueFactory {
   virtual std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) = 0;
   virtual std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
                                                              std::chrono::nanoseconds interval,
-                                                             std::chrono::nanoseconds leeway, Closure handler) = 0;
+                                                             std::chrono::nanoseconds leeway,
+                                                             Closure handler) = 0;
 };
 
 }  // namespace tessel

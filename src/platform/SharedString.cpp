@@ -53,7 +53,8 @@ SharedString::SharedString(std::string_view text, uint64_t hash) {
   if (text.size() > std::numeric_limits<uint32_t>::max()) throw std::length_error("SharedString");
   void* storage = ::operator new(sizeof(StringRecord) + text.size());
   auto* record = new (storage) StringRecord(hash, static_cast<uint32_t>(text.size()));
-  if (!text.empty()) std::memcpy(static_cast<char*>(storage) + sizeof(StringRecord), text.data(), text.size());
+  if (!text.empty())
+    std::memcpy(static_cast<char*>(storage) + sizeof(StringRecord), text.data(), text.size());
   record_ = record;
 }
 

@@ -88,7 +88,9 @@ class SharedString {
   explicit operator bool() const { return present(); }
   // REQUIRES: present().
   std::string_view text() const { return record_->text(); }
-  std::string_view textOr(std::string_view fallback) const { return StringRef(*this).textOr(fallback); }
+  std::string_view textOr(std::string_view fallback) const {
+    return StringRef(*this).textOr(fallback);
+  }
   uint64_t hash() const { return StringRef(*this).hash(); }
 
  private:

@@ -153,10 +153,9 @@ std::shared_ptr<SerialQueue> WorkerQueueFactory::makeSerialQueue(std::string lab
   return std::make_shared<WorkerQueue>(std::move(label));
 }
 
-std::shared_ptr<RepeatingTimer> WorkerQueueFactory::makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
-                                                                       std::chrono::nanoseconds interval,
-                                                                       std::chrono::nanoseconds /*leeway*/,
-                                                                       Closure handler) {
+std::shared_ptr<RepeatingTimer> WorkerQueueFactory::makeRepeatingTimer(
+    std::shared_ptr<SerialQueue> queue, std::chrono::nanoseconds interval,
+    std::chrono::nanoseconds /*leeway*/, Closure handler) {
   // Firings come on time, which every leeway allows.
   return std::make_shared<SharedThreadTimer>(
       std::make_shared<TimerRecord>(TimerRecord{std::move(queue), interval, std::move(handler)}));

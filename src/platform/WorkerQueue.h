@@ -31,7 +31,8 @@ class WorkerQueueFactory final : public QueueFactory {
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;
   std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
                                                      std::chrono::nanoseconds interval,
-                                                     std::chrono::nanoseconds leeway, Closure handler) override;
+                                                     std::chrono::nanoseconds leeway,
+                                                     Closure handler) override;
 };
 
 }  // namespace tessel

@@ -13,11 +13,13 @@ struct Thing {
 
 TEST(LogTest, FillsEveryConversionInOrder) {
   testing::RecordingLog log;
-  tesselReporterLog().debug("%@:\t%llu %ld %u %.2f %f%s\n", Thing{}, uint64_t{18446744073709551615u}, int64_t{-3},
-                            uint32_t{10}, 1.005, 125000.0, " (x)");
+  tesselReporterLog().debug("%@:\t%llu %ld %u %.2f %f%s\n", Thing{},
+                            uint64_t{18446744073709551615u}, int64_t{-3}, uint32_t{10}, 1.005,
+                            125000.0, " (x)");
   tesselReporterLog().error("%@ and %@", SharedString("text %s"), SharedString());
-  EXPECT_EQ(log.lines(), (std::vector<std::string>{"a/b:\t18446744073709551615 -3 10 1.00 125000.000000 (x)\n",
-                                                   "text %s and (null)"}));
+  EXPECT_EQ(log.lines(),
+            (std::vector<std::string>{"a/b:\t18446744073709551615 -3 10 1.00 125000.000000 (x)\n",
+                                      "text %s and (null)"}));
   EXPECT_EQ(log.errors().size(), 1u);
 }
 

@@ -30,9 +30,11 @@ TEST_F(ThrottleTest, TheTenthStepSleepsForTheRestOfTheQuantum) {
   EXPECT_EQ(clock.sleeps, std::vector<uint32_t>{75'000});
   EXPECT_EQ(throttle.throttledCount(), 1u);
   EXPECT_EQ(throttle.throttledMicroseconds(), 75'000u);
-  EXPECT_EQ(log.lines(),
-            (std::vector<std::string>{"125000.000000 us, 125000000.000000 mach time units per quantum of 10 reported events",
-                                      "Sleeping for 75000 us"}));
+  EXPECT_EQ(
+      log.lines(),
+      (std::vector<std::string>{
+          "125000.000000 us, 125000000.000000 mach time units per quantum of 10 reported events",
+          "Sleeping for 75000 us"}));
 }
 
 TEST_F(ThrottleTest, ALongQuantumIsClosedWithoutSleepAndTheNextStartsAtItsEnd) {
@@ -69,7 +71,10 @@ TEST(ThrottleTimebaseTest, TicksCountInTheClocksOwnUnit) {
   clock.ticks += 1'200'000;  // 50,000 us
   throttle.throttleReportedEvent();
   EXPECT_EQ(clock.sleeps, std::vector<uint32_t>{75'000});
-  EXPECT_EQ(log.count("125000.000000 us, 3000000.000000 mach time units per quantum of 10 reported events"), 1u);
+  EXPECT_EQ(
+      log.count(
+          "125000.000000 us, 3000000.000000 mach time units per quantum of 10 reported events"),
+      1u);
 }
 
 }  // namespace

@@ -49,8 +49,9 @@ TEST(RepeatingTimerTest, FiresAtOnceAndGoesOnAfterItsOwnerLetGo) {
   WorkerQueueFactory factory;
   const auto fired = std::make_shared<Semaphore>(0);
   {
-    const auto timer = factory.makeRepeatingTimer(factory.makeSerialQueue("test"), std::chrono::milliseconds(1),
-                                                  std::chrono::milliseconds(1), [fired] { fired->signal(); });
+    const auto timer =
+        factory.makeRepeatingTimer(factory.makeSerialQueue("test"), std::chrono::milliseconds(1),
+                                   std::chrono::milliseconds(1), [fired] { fired->signal(); });
     EXPECT_FALSE(fired->waitFor(std::chrono::milliseconds(0)));
     timer->resume();
   }

@@ -8,7 +8,8 @@ namespace tessel {
 
 bool CookieFile::cookieFileExists() {
   const FileExistence found = files_.existence(cookieFilePath);
-  if (found.exists && found.isDirectory) tesselReporterLog().debug("Cookie file exists but is directory");
+  if (found.exists && found.isDirectory)
+    tesselReporterLog().debug("Cookie file exists but is directory");
   return found.exists;
 }
 
@@ -18,7 +19,8 @@ void CookieFile::clearCookieFile() {
   if (result.removed) {
     tesselReporterLog().debug("Cleared cookie file");
   } else {
-    tesselReporterLog().error("Could not clear cookie file: %@", result.error.value_or("Unknown error"));
+    tesselReporterLog().error("Could not clear cookie file: %@",
+                              result.error.value_or("Unknown error"));
   }
 }
 

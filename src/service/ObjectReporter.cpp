@@ -9,7 +9,8 @@ namespace tessel {
 namespace {
 
 // The event named after the object. An object without a name has none.
-void sendNamedPayloadEvent(EventSender& sender, const TesselObject& object, const Payload& payload) {
+void sendNamedPayloadEvent(EventSender& sender, const TesselObject& object,
+                           const Payload& payload) {
   if (!object.subsystem() || !object.category() || !object.name()) return;
   std::string name = "ts__";
   name.append(object.subsystem().text()).append("__");
@@ -24,8 +25,8 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
   if (!filter_->shouldReportTesselObject(*object, nullptr)) return true;
   std::optional<Payload> payload = object->statoraPayload(road_.identity);
   if (!payload) {
-    tesselReporterLog().debug("Failed to create payload for %@/%@%@", object->subsystem(), object->category(),
-                              object->name());
+    tesselReporterLog().debug("Failed to create payload for %@/%@%@", object->subsystem(),
+                              object->category(), object->name());
     return true;
   }
   payload->set("BootPartitionFS", bootFilesystem_);
@@ -34,12 +35,15 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
   return true;
 }
 
-void ObjectReporter::send(const std::shared_ptr<const TesselObject>& object, std::shared_ptr<const Payload> payload) {
+void ObjectReporter::send(const std::shared_ptr<const TesselObject>& object,
+                          std::shared_ptr<const Payload> payload) {
   EventSender& sender = road_.sender;
   road_.throttle.throttleReportedEvent();
-  road_.reportingQueue.async([&sender, payload] { sender.sendEvent("com.vantor.performance.tessel", *payload); });
+  road_.reportingQueue.async(
+      [&sender, payload] { sender.sendEvent("com.vantor.performance.tessel", *payload); });
   road_.throttle.throttleReportedEvent();
-  road_.reportingQueue.async([&sender, object, payload] { sendNamedPayloadEvent(sender, *object, *payload); });
+  road_.reportingQueue.async(
+      [&sender, object, payload] { sendNamedPayloadEvent(sender, *object, *payload); });
 }
 
 }  // namespace tessel

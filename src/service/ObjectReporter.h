@@ -30,13 +30,17 @@ class ObjectReporter {
   // `bootFilesystem` may be absent.
   ObjectReporter(const EventRoad& road, std::shared_ptr<TesselReporterObjectFilter> filter,
                  SharedString bootFilesystem, SharedString bootDisk)
-      : road_(road), filter_(std::move(filter)), bootFilesystem_(std::move(bootFilesystem)), bootDisk_(std::move(bootDisk)) {}
+      : road_(road),
+        filter_(std::move(filter)),
+        bootFilesystem_(std::move(bootFilesystem)),
+        bootDisk_(std::move(bootDisk)) {}
 
   // Always true.
   bool reportTesselObject(const std::shared_ptr<const TesselObject>& object);
 
  private:
-  void send(const std::shared_ptr<const TesselObject>& object, std::shared_ptr<const Payload> payload);
+  void send(const std::shared_ptr<const TesselObject>& object,
+            std::shared_ptr<const Payload> payload);
 
   const EventRoad road_;
   const std::shared_ptr<TesselReporterObjectFilter> filter_;

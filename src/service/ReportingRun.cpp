@@ -60,7 +60,8 @@ RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   const bool processed = extract(*extractor, startDate, endDate);
   observer_.runReached("summarising");
   road_.reportingQueue.sync([&] {
-    summary_.reportRunSummary(*filter, *extractor, startDate, endDate, *interruptedByDeferral, startTime);
+    summary_.reportRunSummary(*filter, *extractor, startDate, endDate, *interruptedByDeferral,
+                              startTime);
   });
   return {processed ? RunOutcome::completed : RunOutcome::extractionFailed,
           startDate,
@@ -81,18 +82,19 @@ std::shared_ptr<ObjectReporter> ReportingRun::makeObjectReporter(
 
 void ReportingRun::installCallbacks(TesselSupportObjectExtractor& extractor,
                                     const std::shared_ptr<ObjectReporter>& reporter) {
-  const auto reportTesselObject = [reporter, &observer = observer_](const std::shared_ptr<const TesselObject>& object) {
-    observer.objectDelivered();
-    return reporter->reportTesselObject(object);
-  };
+  const auto reportTesselObject =
+      [reporter, &observer = observer_](const std::shared_ptr<const TesselObject>& object) {
+        observer.objectDelivered();
+        return reporter->reportTesselObject(object);
+      };
   extractor.setIntervalCompletionProcessingBlock(reportTesselObject);
   extractor.setAnimationIntervalCompletionProcessingBlock(reportTesselObject);
   extractor.setEmitEventProcessingBlock(reportTesselObject);
 }
 
-void ReportingRun::startDeferralPoll(const std::shared_ptr<Activity>& activity,
-                                     const InterruptedCell& interruptedByDeferral,
-                                     const std::shared_ptr<TesselSupportObjectExtractor>& extractor) {
+void ReportingRun::startDeferralPoll(
+    const std::shared_ptr<Activity>& activity, const InterruptedCell& interruptedByDeferral,
+    const std::shared_ptr<TesselSupportObjectExtractor>& extractor) {
   const auto queue = surroundings_.queues.makeSerialQueue("tessel_reporter defer polling queue");
   const std::weak_ptr<TesselSupportObjectExtractor> weakExtractor = extractor;
   surroundings_.queues

@@ -27,7 +27,8 @@ namespace tessel {
 // How a run ended.
 enum class RunOutcome { notTasked, bailedOut, noMarker, completed, extractionFailed };
 
-// What is known of a run when it has ended. A run that read nothing has neither filter nor extractor.
+// What is known of a run when it has ended. A run that read nothing has neither filter nor
+// extractor.
 struct RunReport {
   RunOutcome outcome = RunOutcome::notTasked;
   Date startDate{};  // of the period read
@@ -57,7 +58,8 @@ struct RunSurroundings {
 class ReportingRun {
  public:
   ReportingRun(TaskingGate& gate, CookieFile& cookie, const RunSurroundings& surroundings,
-               ExtractorFactory makeExtractor, const EventRoad& road, RunSummary& summary, RunObserver& observer)
+               ExtractorFactory makeExtractor, const EventRoad& road, RunSummary& summary,
+               RunObserver& observer)
       : gate_(gate),
         cookie_(cookie),
         surroundings_(surroundings),
@@ -72,10 +74,13 @@ class ReportingRun {
   using InterruptedCell = std::shared_ptr<std::atomic<bool>>;
 
   RunReport report(const std::shared_ptr<Activity>& activity);
-  std::shared_ptr<ObjectReporter> makeObjectReporter(const std::shared_ptr<TesselReporterObjectFilter>& filter);
-  void installCallbacks(TesselSupportObjectExtractor& extractor, const std::shared_ptr<ObjectReporter>& reporter);
+  std::shared_ptr<ObjectReporter> makeObjectReporter(
+      const std::shared_ptr<TesselReporterObjectFilter>& filter);
+  void installCallbacks(TesselSupportObjectExtractor& extractor,
+                        const std::shared_ptr<ObjectReporter>& reporter);
   bool extract(TesselSupportObjectExtractor& extractor, Date startDate, Date endDate);
-  void startDeferralPoll(const std::shared_ptr<Activity>& activity, const InterruptedCell& interruptedByDeferral,
+  void startDeferralPoll(const std::shared_ptr<Activity>& activity,
+                         const InterruptedCell& interruptedByDeferral,
                          const std::shared_ptr<TesselSupportObjectExtractor>& extractor);
 
   TaskingGate& gate_;

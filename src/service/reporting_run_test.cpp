@@ -64,19 +64,22 @@ class ReportingRunTest : public ::testing::Test {
   ProcessIdentity identity{bundles};
   RunSummary summary{sender, throttle, clock, dates};
   const EventRoad road{identity, throttle, sender, reportingQueue};
-  ReportingRun run{gate,    cookie,   {queues, clock, volumes, variant}, [this] { return nextExtractor(); }, road,
-                   summary, observer};
+  ReportingRun run{
+      gate,    cookie,  {queues, clock, volumes, variant}, [this] { return nextExtractor(); }, road,
+      summary, observer};
 };
 
 TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
   extractor->duringProcessing = [this] { EXPECT_TRUE(files.items.contains(cookieFilePath)); };
   perform();
   EXPECT_EQ(linesBeforeSummary(),
-            (std::vector<std::string>{"Reporting based on os_flavor result", "Created cookie file", "(extractor made)",
-                                      "Filesystem for '/': ext4", "Boot disk type: SSD"}));
+            (std::vector<std::string>{"Reporting based on os_flavor result", "Created cookie file",
+                                      "(extractor made)", "Filesystem for '/': ext4",
+                                      "Boot disk type: SSD"}));
   EXPECT_EQ(log.lines().back(), "Cleared cookie file");
-  EXPECT_EQ(extractor->calls, (std::vector<std::string>{"interval callback", "animation callback", "event callback",
-                                                        "composite off", "process"}));
+  EXPECT_EQ(extractor->calls,
+            (std::vector<std::string>{"interval callback", "animation callback", "event callback",
+                                      "composite off", "process"}));
   EXPECT_EQ(extractor->processedPath, std::nullopt);
   EXPECT_EQ(extractor->endDate - extractor->startDate, std::chrono::hours{24});
   EXPECT_EQ(extractor->endDate, clock.date);
@@ -98,9 +101,10 @@ TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsBeforeTheSummary) {
   }
   EXPECT_EQ(names[6], "com.vantor.performance.tessel_counts");
   EXPECT_EQ(names.back(), "com.vantor.performance.tessel_reporting_stats");
-  EXPECT_EQ(sender.events[0].json,
-            R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open","IntervalType":"Event",)"
-            R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
+  EXPECT_EQ(
+      sender.events[0].json,
+      R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open","IntervalType":"Event",)"
+      R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
   EXPECT_EQ(observer.delivered, 3u);
 }
 
@@ -118,8 +122,9 @@ TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
   files.items[cookieFilePath] = true;
   perform();
   EXPECT_EQ(log.lines(), (std::vector<std::string>{
-                             "Reporting based on os_flavor result", "Cookie file exists but is directory",
-                             "Bailing due to cookie file", "Cookie file exists but is directory", "Cleared cookie file"}));
+                             "Reporting based on os_flavor result",
+                             "Cookie file exists but is directory", "Bailing due to cookie file",
+                             "Cookie file exists but is directory", "Cleared cookie file"}));
   EXPECT_TRUE(sender.events.empty());
   perform();
   EXPECT_EQ(sender.names().back(), "com.vantor.performance.tessel_reporting_stats");
@@ -212,8 +217,9 @@ TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   queues.timers.back()->fire();
   activity->deferWanted = true;
   queues.runAll();
-  EXPECT_EQ(log.lines(), (std::vector<std::string>{"Trying to stop in-flight reporting work.",
-                                                   "Concluding processing due to deferral request"}));
+  EXPECT_EQ(log.lines(),
+            (std::vector<std::string>{"Trying to stop in-flight reporting work.",
+                                      "Concluding processing due to deferral request"}));
   activity->deferWanted = false;
   log.clear();
   queues.timers.back()->fire();
@@ -234,10 +240,12 @@ TEST_F(ReportingRunTest, FivePairsOfASectionAreSentAndTheRestOnlyCounted) {
     if (event.name == "com.vantor.performance.tessel_counts") counts.push_back(event.json);
   }
   ASSERT_EQ(counts.size(), 5u);
-  EXPECT_EQ(counts[0],
-            R"({"Subsystem":"com.vantor.Calendar","Category":"C6","Count":7,"Classification":"AllInspected"})");
-  EXPECT_EQ(counts[4],
-            R"({"Subsystem":"com.vantor.Calendar","Category":"C2","Count":3,"Classification":"AllInspected"})");
+  EXPECT_EQ(
+      counts[0],
+      R"({"Subsystem":"com.vantor.Calendar","Category":"C6","Count":7,"Classification":"AllInspected"})");
+  EXPECT_EQ(
+      counts[4],
+      R"({"Subsystem":"com.vantor.Calendar","Category":"C2","Count":3,"Classification":"AllInspected"})");
   EXPECT_EQ(log.count("com.vantor.Calendar/C2:\t3 (Count reported to Statora)"), 1u);
   EXPECT_EQ(log.count("com.vantor.Calendar/C1:\t2 (Count not reported)"), 1u);
   EXPECT_EQ(log.count("**************\nTotal tessel object count: 28"), 1u);
@@ -259,10 +267,11 @@ TEST_F(ReportingRunTest, EachSectionStartsItsFiveAnew) {
     const auto at = event.json.find("\"Classification\":");
     if (at != std::string::npos) ++perSection[event.json.substr(at)];
   }
-  EXPECT_EQ(perSection, (std::map<std::string, int>{{"\"Classification\":\"AllInspected\"}", 5},
-                                                    {"\"Classification\":\"Reported\"}", 5},
-                                                    {"\"Classification\":\"ReportedEvents\"}", 5},
-                                                    {"\"Classification\":\"DurationThresholdFiltered\"}", 5}}));
+  EXPECT_EQ(perSection,
+            (std::map<std::string, int>{{"\"Classification\":\"AllInspected\"}", 5},
+                                        {"\"Classification\":\"Reported\"}", 5},
+                                        {"\"Classification\":\"ReportedEvents\"}", 5},
+                                        {"\"Classification\":\"DurationThresholdFiltered\"}", 5}}));
 }
 
 TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
@@ -275,20 +284,24 @@ TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
   capped.subsystem = "com.vantor.quellan.knowledge";
   capped.category = "tessel";
   capped.name = "Footprint";
-  extractor->objects = {makeEvent(reported),         makeEvent(reported),     makeInterval(reported),
-                        makeEvent(disabled),         makeInterval(disabled),  makeInterval(negative),
+  extractor->objects = {makeEvent(reported),           makeEvent(reported),
+                        makeInterval(reported),        makeEvent(disabled),
+                        makeInterval(disabled),        makeInterval(negative),
                         makeAnimationInterval(capped), makeAnimationInterval(reported)};
   extractor->eventCount = 99;
   extractor->duringProcessing = [this] { clock.advance(std::chrono::milliseconds{1250}); };
   perform();
-  EXPECT_EQ(sender.events.back().json,
-            R"({"ProcessingDurationInSeconds":1.25,"LogObjectsProcessed":99,"AnimationsReported":1,)"
-            R"("IntervalsReported":1,"EventsReported":2,"AnimationsNotReported":1,"IntervalsNotReported":2,)"
-            R"("EventsNotReported":1,"WasInterrupted":false})");
+  EXPECT_EQ(
+      sender.events.back().json,
+      R"({"ProcessingDurationInSeconds":1.25,"LogObjectsProcessed":99,"AnimationsReported":1,)"
+      R"("IntervalsReported":1,"EventsReported":2,"AnimationsNotReported":1,"IntervalsNotReported":2,)"
+      R"("EventsNotReported":1,"WasInterrupted":false})");
   const std::string from = dates.format(extractor->startDate);
   const std::string to = dates.format(extractor->endDate);
-  EXPECT_EQ(log.count("Done processing 2 reported and 1 unreported events, 1 reported and 2 unreported intervals and 1 "
-                      "reported and 1 unreported animations (1 blacklisted, 1 too short, 0 whitelisted, 2 telemetry not "
+  EXPECT_EQ(log.count("Done processing 2 reported and 1 unreported events, 1 reported and 2 "
+                      "unreported intervals and 1 "
+                      "reported and 1 unreported animations (1 blacklisted, 1 too short, 0 "
+                      "whitelisted, 2 telemetry not "
                       "enabled) from 99 log events in 1.25s between " +
                       from + " and " + to + "\n"),
             1u);
@@ -300,7 +313,8 @@ TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
   for (int i = 0; i < 5; ++i) extractor->objects.push_back(makeEvent(TestPoint{}));
   perform();
   ASSERT_EQ(throttle.throttledCount(), 1u);
-  const std::string line = "Throttled 1 times for a total of " + std::to_string(throttle.throttledMicroseconds()) + " usec";
+  const std::string line = "Throttled 1 times for a total of " +
+                           std::to_string(throttle.throttledMicroseconds()) + " usec";
   EXPECT_EQ(log.count(line), 1u);
   extractor->objects.clear();
   perform();
@@ -329,7 +343,10 @@ TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTrans
   const struct {
     int64_t state;
     const char* line;
-  } cases[] = {{0, "Checking in\n"}, {1, "Unknown state 1\n"}, {3, "Unknown state 3\n"}, {-5, "Unknown state -5\n"}};
+  } cases[] = {{0, "Checking in\n"},
+               {1, "Unknown state 1\n"},
+               {3, "Unknown state 3\n"},
+               {-5, "Unknown state -5\n"}};
   for (const auto& c : cases) {
     log.clear();
     runtime.calls.clear();

@@ -10,7 +10,8 @@ namespace {
 
 constexpr uint64_t kLastSentPosition = 4;
 
-Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count, std::string_view classification) {
+Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count,
+                     std::string_view classification) {
   Payload payload;
   payload.set("Subsystem", key.subsystem());
   payload.set("Category", key.category());
@@ -22,13 +23,15 @@ Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count, st
 }  // namespace
 
 void CountReporter::reportCountForKey(const TesselReporterAggregationKey& key,
-                                      const TesselReporterAggregation& aggregation, std::string_view classification) {
+                                      const TesselReporterAggregation& aggregation,
+                                      std::string_view classification) {
   throttle_.throttleReportedEvent();
   const uint64_t count = aggregation.countForKey(key);
   if (sectionKeyCount_ > kLastSentPosition) {
     tesselReporterLog().debug("%@:\t%llu (Count not reported)", key, count);
   } else {
-    sender_.sendEvent("com.vantor.performance.tessel_counts", countPayload(key, count, classification));
+    sender_.sendEvent("com.vantor.performance.tessel_counts",
+                      countPayload(key, count, classification));
     tesselReporterLog().debug("%@:\t%llu (Count reported to Statora)", key, count);
   }
   ++sectionKeyCount_;

@@ -19,7 +19,8 @@ class CountReporter {
   // Starts a section: its first five keys are sent, the others only logged.
   void beginSection() { sectionKeyCount_ = 0; }
   // Handles the next key of the section. REQUIRES: `aggregation` holds `key`.
-  void reportCountForKey(const TesselReporterAggregationKey& key, const TesselReporterAggregation& aggregation,
+  void reportCountForKey(const TesselReporterAggregationKey& key,
+                         const TesselReporterAggregation& aggregation,
                          std::string_view classification);
 
  private:

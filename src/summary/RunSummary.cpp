@@ -18,10 +18,12 @@ struct Section {
 using Filter = TesselReporterObjectFilter;
 
 constexpr Section kSections[] = {
-    {"**************\nTotal tessel object count: %llu", &Filter::allInspectedTesselObjectsAggregation, "AllInspected"},
-    {"**************\nReported tessel object count: %llu", &Filter::telemetryReportedAggregation, "Reported"},
-    {"**************\nReported tessel event count: %llu", &Filter::telemetryReportedEventsAggregation,
-     "ReportedEvents"},
+    {"**************\nTotal tessel object count: %llu",
+     &Filter::allInspectedTesselObjectsAggregation, "AllInspected"},
+    {"**************\nReported tessel object count: %llu", &Filter::telemetryReportedAggregation,
+     "Reported"},
+    {"**************\nReported tessel event count: %llu",
+     &Filter::telemetryReportedEventsAggregation, "ReportedEvents"},
     {"**************\nSubsystem/category filtered tessel object count: %llu",
      &Filter::telemetryNotReportedFailedSCFilterAggregation, "SubsystemCategoryFiltered"},
     {"**************\nDuration filtered tessel object count: %llu",
@@ -30,8 +32,9 @@ constexpr Section kSections[] = {
      &Filter::telemetryNotReportedFailedStringWhitelistAggregation, "StringWhitelistFiltered"},
 };
 
-Payload runSummaryPayload(const TesselReporterObjectFilter& filter, const TesselSupportObjectExtractor& extractor,
-                          float seconds, bool interrupted) {
+Payload runSummaryPayload(const TesselReporterObjectFilter& filter,
+                          const TesselSupportObjectExtractor& extractor, float seconds,
+                          bool interrupted) {
   Payload payload;
   payload.set("ProcessingDurationInSeconds", Number{seconds});
   payload.set("LogObjectsProcessed", Number{extractor.processedEventCount()});
@@ -48,8 +51,9 @@ Payload runSummaryPayload(const TesselReporterObjectFilter& filter, const Tessel
 }  // namespace
 
 void RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
-                                  const TesselSupportObjectExtractor& extractor, Date startDate, Date endDate,
-                                  const std::atomic<bool>& interruptedByDeferral, uint64_t processingStartTime) {
+                                  const TesselSupportObjectExtractor& extractor, Date startDate,
+                                  Date endDate, const std::atomic<bool>& interruptedByDeferral,
+                                  uint64_t processingStartTime) {
   reportSections(filter);
   const float seconds = secondsSince(processingStartTime);
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
@@ -57,12 +61,15 @@ void RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
   const LogHandle& log = tesselReporterLog();
   if (log.isEnabled(LogLevel::debug)) {
     log.debug(
-        "Done processing %llu reported and %llu unreported events, %llu reported and %llu unreported intervals and "
-        "%llu reported and %llu unreported animations (%llu blacklisted, %llu too short, %llu whitelisted, %llu "
+        "Done processing %llu reported and %llu unreported events, %llu reported and %llu "
+        "unreported intervals and "
+        "%llu reported and %llu unreported animations (%llu blacklisted, %llu too short, %llu "
+        "whitelisted, %llu "
         "telemetry not enabled) from %llu log events in %.2fs between %@ and %@%s\n",
-        filter.totalReportedEventCount(), filter.totalUnreportedEventCount(), filter.totalReportedIntervalCount(),
-        filter.totalUnreportedIntervalCount(), filter.totalReportedAnimationCount(),
-        filter.totalUnreportedAnimationCount(), filter.telemetryNotReportedFailedSCFilterAggregation().totalCount(),
+        filter.totalReportedEventCount(), filter.totalUnreportedEventCount(),
+        filter.totalReportedIntervalCount(), filter.totalUnreportedIntervalCount(),
+        filter.totalReportedAnimationCount(), filter.totalUnreportedAnimationCount(),
+        filter.telemetryNotReportedFailedSCFilterAggregation().totalCount(),
         filter.telemetryNotReportedDurationThresholdAggregation().totalCount(),
         filter.telemetryNotReportedFailedStringWhitelistAggregation().totalCount(),
         filter.telemetryDisabledAggregation().totalCount(), extractor.processedEventCount(),
@@ -91,7 +98,8 @@ float RunSummary::secondsSince(uint64_t startTime) {
   const uint64_t endTime = clock_.continuousTicks();
   std::call_once(factorMade_, [this] {
     const Timebase timebase = clock_.timebase();
-    secondsPerTick_ = static_cast<double>(timebase.numerator) * 1e-9 / static_cast<double>(timebase.denominator);
+    secondsPerTick_ =
+        static_cast<double>(timebase.numerator) * 1e-9 / static_cast<double>(timebase.denominator);
   });
   return static_cast<float>(static_cast<double>(endTime - startTime) * secondsPerTick_);
 }

@@ -27,8 +27,9 @@ class RunSummary {
 
   // `startDate` and `endDate` bound the period that was read; `processingStartTime` is in ticks of
   // the continuous clock. `interruptedByDeferral` may still change while the summary runs.
-  void reportRunSummary(const TesselReporterObjectFilter& filter, const TesselSupportObjectExtractor& extractor,
-                        Date startDate, Date endDate, const std::atomic<bool>& interruptedByDeferral,
+  void reportRunSummary(const TesselReporterObjectFilter& filter,
+                        const TesselSupportObjectExtractor& extractor, Date startDate, Date endDate,
+                        const std::atomic<bool>& interruptedByDeferral,
                         uint64_t processingStartTime);
 
  private:

@@ -21,8 +21,12 @@ namespace tessel {
 
 class TaskingGate {
  public:
-  TaskingGate(BuildVariant& buildVariant, ConfigurationService& configurations, QueueFactory& queues, Clock& clock)
-      : buildVariant_(buildVariant), configurations_(configurations), queues_(queues), clock_(clock) {}
+  TaskingGate(BuildVariant& buildVariant, ConfigurationService& configurations,
+              QueueFactory& queues, Clock& clock)
+      : buildVariant_(buildVariant),
+        configurations_(configurations),
+        queues_(queues),
+        clock_(clock) {}
 
   // Blocks the caller for at most 5 seconds.
   bool shouldReport();
@@ -37,7 +41,8 @@ class TaskingGate {
 };
 
 // The decision that one delivered configuration yields; null is an absent one.
-bool taskingDecisionForConfiguration(const ConfigurationValue* configuration, const std::string& type);
+bool taskingDecisionForConfiguration(const ConfigurationValue* configuration,
+                                     const std::string& type);
 
 // The decision for what stands under "TaskedOn"; null where nothing does.
 bool taskingDecisionForTaskedOnValue(const ConfigurationValue* value);

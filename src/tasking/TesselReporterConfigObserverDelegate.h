@@ -17,7 +17,8 @@ namespace tessel {
 class TesselReporterConfigObserverDelegate final : public ConfigurationObserverDelegate {
  public:
   // Takes the configuration, null where it is absent, and its type.
-  using CallbackBlock = std::function<void(const std::shared_ptr<const ConfigurationValue>&, const std::string&)>;
+  using CallbackBlock =
+      std::function<void(const std::shared_ptr<const ConfigurationValue>&, const std::string&)>;
 
   explicit TesselReporterConfigObserverDelegate(CallbackBlock callbackBlock)
       : callbackBlock_(std::move(callbackBlock)) {}
@@ -25,9 +26,10 @@ class TesselReporterConfigObserverDelegate final : public ConfigurationObserverD
   const CallbackBlock& callbackBlock() const { return callbackBlock_; }
   void setCallbackBlock(CallbackBlock callbackBlock) { callbackBlock_ = std::move(callbackBlock); }
 
-  void observerDidChangeConfiguration(ConfigurationObserver& /*observer*/,
-                                      const std::shared_ptr<const ConfigurationValue>& configuration,
-                                      const std::string& type) override {
+  void observerDidChangeConfiguration(
+      ConfigurationObserver& /*observer*/,
+      const std::shared_ptr<const ConfigurationValue>& configuration,
+      const std::string& type) override {
     callbackBlock_(configuration, type);
   }
 

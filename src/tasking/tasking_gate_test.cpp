@@ -21,9 +21,11 @@ std::shared_ptr<const ConfigurationValue> taskedOn(ConfigurationValue value) {
 class TaskingGateTest : public ::testing::Test {
  protected:
   // Delivers the configurations while the gate waits.
-  bool ask(std::vector<std::pair<std::shared_ptr<const ConfigurationValue>, std::string>> deliveries) {
+  bool ask(
+      std::vector<std::pair<std::shared_ptr<const ConfigurationValue>, std::string>> deliveries) {
     clock.whileWaiting = [this, deliveries = std::move(deliveries)] {
-      for (const auto& [value, type] : deliveries) configurations.observers.back()->deliver(value, type);
+      for (const auto& [value, type] : deliveries)
+        configurations.observers.back()->deliver(value, type);
       queues.runAll();
     };
     return gate.shouldReport();
@@ -48,12 +50,14 @@ TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
 
 TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSeconds) {
   EXPECT_FALSE(gate.shouldReport());
-  EXPECT_EQ(log.lines(),
-            std::vector<std::string>{
-                "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"});
+  EXPECT_EQ(
+      log.lines(),
+      std::vector<std::string>{
+          "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"});
   EXPECT_EQ(clock.waits, std::vector<std::chrono::nanoseconds>{std::chrono::seconds{5}});
   EXPECT_EQ(configurations.observers.at(0)->observed, std::vector<std::string>{kType});
-  EXPECT_EQ(configurations.observers.at(0)->queue->label(), "tessel_reporter configuration observing queue");
+  EXPECT_EQ(configurations.observers.at(0)->queue->label(),
+            "tessel_reporter configuration observing queue");
 }
 
 TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
@@ -64,12 +68,16 @@ TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
     const char* line;
   } cases[] = {
       {taskedOn({Number{true}}), "com.vantor.other", false,
-       "Not reporting based on not being tasked-on by Statora (unexpected type string: 'com.vantor.other')"},
-      {nullptr, kType, false, "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
+       "Not reporting based on not being tasked-on by Statora (unexpected type string: "
+       "'com.vantor.other')"},
+      {nullptr, kType, false,
+       "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
       {configuration({ConfigurationValue::List{}}), kType, false,
-       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"},
+       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
+       "object)"},
       {configuration({std::string("TaskedOn")}), kType, false,
-       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"},
+       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
+       "object)"},
       {configuration({Dictionary{{"taskedOn", {Number{true}}}}}), kType, false,
        "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"},
       {taskedOn({std::string("true")}), kType, false,
@@ -79,7 +87,8 @@ TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
       {taskedOn({Number{int64_t{0}}}), kType, false,
        "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
       {taskedOn({Number{true}}), kType, true, "Reporting based on being tasked-on by Statora"},
-      {taskedOn({Number{int64_t{1}}}), kType, true, "Reporting based on being tasked-on by Statora"},
+      {taskedOn({Number{int64_t{1}}}), kType, true,
+       "Reporting based on being tasked-on by Statora"},
   };
   for (const auto& c : cases) {
     log.clear();

@@ -31,8 +31,10 @@ TracePointFields fieldsOf(const TestPoint& point, const std::shared_ptr<StringPo
 
 IntervalFields intervalOf(const TestPoint& point, StringPool& pool) {
   IntervalFields interval;
-  interval.beginEvent = {internText(pool, point.beginImagePath), internText(pool, point.beginProcessName)};
-  interval.endEvent = {internText(pool, point.endImagePath), internText(pool, point.endProcessName)};
+  interval.beginEvent = {internText(pool, point.beginImagePath),
+                         internText(pool, point.beginProcessName)};
+  interval.endEvent = {internText(pool, point.endImagePath),
+                       internText(pool, point.endProcessName)};
   for (const auto& [key, value] : point.attributes) {
     interval.attributes.emplace_back(pool.intern(key), pool.intern(value));
   }
@@ -47,7 +49,8 @@ std::shared_ptr<const TesselObject> makeObject(const TestPoint& point) {
 
 std::shared_ptr<const TesselEvent> makeEvent(const TestPoint& point) {
   auto pool = std::make_shared<StringPool>();
-  const EmittingProcess process{internText(*pool, point.beginImagePath), internText(*pool, point.beginProcessName)};
+  const EmittingProcess process{internText(*pool, point.beginImagePath),
+                                internText(*pool, point.beginProcessName)};
   return std::make_shared<TesselEvent>(fieldsOf(point, pool), process);
 }
 
@@ -60,7 +63,8 @@ std::shared_ptr<const TesselInterval> makeInterval(const TestPoint& point) {
 std::shared_ptr<const TesselAnimationInterval> makeAnimationInterval(const TestPoint& point) {
   auto pool = std::make_shared<StringPool>();
   auto interval = intervalOf(point, *pool);
-  return std::make_shared<TesselAnimationInterval>(fieldsOf(point, pool), std::move(interval), point.frameRate);
+  return std::make_shared<TesselAnimationInterval>(fieldsOf(point, pool), std::move(interval),
+                                                   point.frameRate);
 }
 
 void FakeExtractor::setIntervalCompletionProcessingBlock(IntervalCallback callback) {
@@ -68,7 +72,8 @@ void FakeExtractor::setIntervalCompletionProcessingBlock(IntervalCallback callba
   interval_ = std::move(callback);
 }
 
-void FakeExtractor::setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) {
+void FakeExtractor::setAnimationIntervalCompletionProcessingBlock(
+    AnimationIntervalCallback callback) {
   calls.push_back("animation callback");
   animation_ = std::move(callback);
 }
@@ -82,8 +87,8 @@ void FakeExtractor::setBuildAnimationCompositeIntervalTimelines(bool build) {
   calls.push_back(build ? "composite on" : "composite off");
 }
 
-bool FakeExtractor::processLogArchiveWithPath(const std::optional<std::string>& path, Date start, Date end,
-                                              std::optional<PlatformError>& errorOut) {
+bool FakeExtractor::processLogArchiveWithPath(const std::optional<std::string>& path, Date start,
+                                              Date end, std::optional<PlatformError>& errorOut) {
   calls.push_back("process");
   processedPath = path;
   startDate = start;

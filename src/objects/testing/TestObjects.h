@@ -38,8 +38,8 @@ struct FakeExtractor final : TesselSupportObjectExtractor {
   void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
   void setEmitEventProcessingBlock(EventCallback callback) override;
   void setBuildAnimationCompositeIntervalTimelines(bool build) override;
-  bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate, Date endDate,
-                                 std::optional<PlatformError>& errorOut) override;
+  bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
+                                 Date endDate, std::optional<PlatformError>& errorOut) override;
   void stopProcessing() override;
   uint64_t processedEventCount() const override { return eventCount; }
 

@@ -7,7 +7,8 @@
 
 namespace tessel::testing {
 
-void RecordingLog::write(LogLevel level, std::string_view, std::string_view, std::string_view text) {
+void RecordingLog::write(LogLevel level, std::string_view, std::string_view,
+                         std::string_view text) {
   const std::lock_guard lock(mutex_);
   lines_.emplace_back(level, text);
 }
@@ -30,8 +31,8 @@ std::vector<std::string> RecordingLog::errors() const {
 
 size_t RecordingLog::count(std::string_view text) const {
   const std::lock_guard lock(mutex_);
-  return static_cast<size_t>(
-      std::count_if(lines_.begin(), lines_.end(), [&](const auto& line) { return line.second == text; }));
+  return static_cast<size_t>(std::count_if(lines_.begin(), lines_.end(),
+                                           [&](const auto& line) { return line.second == text; }));
 }
 
 void RecordingLog::clear() {
@@ -74,10 +75,9 @@ std::shared_ptr<SerialQueue> ManualQueueFactory::makeSerialQueue(std::string lab
   return queues.emplace_back(std::make_shared<ManualQueue>(std::move(label)));
 }
 
-std::shared_ptr<RepeatingTimer> ManualQueueFactory::makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
-                                                                       std::chrono::nanoseconds interval,
-                                                                       std::chrono::nanoseconds leeway,
-                                                                       Closure handler) {
+std::shared_ptr<RepeatingTimer> ManualQueueFactory::makeRepeatingTimer(
+    std::shared_ptr<SerialQueue> queue, std::chrono::nanoseconds interval,
+    std::chrono::nanoseconds leeway, Closure handler) {
   auto timer = std::make_shared<ManualTimer>();
   timer->queue = std::move(queue);
   timer->interval = interval;
@@ -121,13 +121,15 @@ std::vector<std::string> RememberingSender::names() const {
   return all;
 }
 
-void FakeConfigurationObserver::setDelegate(std::shared_ptr<ConfigurationObserverDelegate> delegateIn,
-                                            std::shared_ptr<SerialQueue> queueIn) {
+void FakeConfigurationObserver::setDelegate(
+    std::shared_ptr<ConfigurationObserverDelegate> delegateIn,
+    std::shared_ptr<SerialQueue> queueIn) {
   delegate = std::move(delegateIn);
   queue = std::move(queueIn);
 }
 
-void FakeConfigurationObserver::deliver(std::shared_ptr<const ConfigurationValue> configuration, std::string type) {
+void FakeConfigurationObserver::deliver(std::shared_ptr<const ConfigurationValue> configuration,
+                                        std::string type) {
   queue->async([this, configuration = std::move(configuration), type = std::move(type)] {
     delegate->observerDidChangeConfiguration(*this, configuration, type);
   });
@@ -143,7 +145,9 @@ FileExistence FakeFiles::existence(const std::string& path) {
   return {true, item->second};
 }
 
-bool FakeFiles::createFile(const std::string& path) { return canCreate && items.emplace(path, false).second; }
+bool FakeFiles::createFile(const std::string& path) {
+  return canCreate && items.emplace(path, false).second;
+}
 
 RemovalResult FakeFiles::remove(const std::string& path) {
   if (removal) return *removal;
@@ -165,7 +169,8 @@ bool FakeBuildVariant::hasInternalDiagnostics(std::string_view subsystem) {
 }
 
 std::string FakeDates::format(Date date) {
-  return std::to_string(std::chrono::duration_cast<std::chrono::seconds>(date.time_since_epoch()).count());
+  return std::to_string(
+      std::chrono::duration_cast<std::chrono::seconds>(date.time_since_epoch()).count());
 }
 
 }  // namespace tessel::testing

@@ -90,7 +90,8 @@ struct ManualQueueFactory final : QueueFactory {
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;
   std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
                                                      std::chrono::nanoseconds interval,
-                                                     std::chrono::nanoseconds leeway, Closure handler) override;
+                                                     std::chrono::nanoseconds leeway,
+                                                     Closure handler) override;
   void runAll();
 
   std::vector<std::shared_ptr<ManualQueue>> queues;
@@ -112,7 +113,9 @@ struct FakeActivity final : Activity {
 struct FakeRuntime final : Runtime {
   std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) override;
   void requestCleanExit() override { calls.push_back("clean exit"); }
-  std::shared_ptr<SignalSource> makeSignalSource(int, std::shared_ptr<SerialQueue>) override { return nullptr; }
+  std::shared_ptr<SignalSource> makeSignalSource(int, std::shared_ptr<SerialQueue>) override {
+    return nullptr;
+  }
   [[noreturn]] void runMainLoop() override;
 
   std::vector<std::string> calls;
