@@ -16,6 +16,7 @@
 #include "platform/Log.h"
 #include "platform/Runtime.h"
 #include "platform/SerialQueue.h"
+#include "platform/ServiceStatus.h"
 #include "platform/System.h"
 
 namespace tessel::testing {
@@ -119,6 +120,15 @@ struct FakeRuntime final : Runtime {
   [[noreturn]] void runMainLoop() override;
 
   std::vector<std::string> calls;
+};
+
+// Remembers what the process said it was doing.
+struct FakeServiceStatus final : ServiceStatus {
+  void say(std::string_view words) override { said.emplace_back(words); }
+  void progress() override { ++steps; }
+
+  std::vector<std::string> said;
+  size_t steps = 0;
 };
 
 struct SentEvent {
