@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -25,9 +26,15 @@ class TemporaryDirectory {
 
   const std::string& path() const { return path_; }
   std::string path(std::string_view name) const { return path_ + "/" + std::string(name); }
-  // Writes a file in place.
-  void write(std::string_view name, std::string_view text) const {
+  // Writes a file in place, making the directories above it; answers its path.
+  std::string write(std::string_view name, std::string_view text) const {
+    std::filesystem::create_directories(std::filesystem::path(path(name)).parent_path());
     std::ofstream(path(name), std::ios::binary | std::ios::trunc) << text;
+    return path(name);
+  }
+  std::string read(std::string_view name) const {
+    std::ifstream file(path(name), std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), {}};
   }
 
  private:

@@ -1,0 +1,145 @@
+// Reading the launch variables.
+
+#include "linux/LaunchConfiguration.h"
+
+#include <charconv>
+#include <cstdlib>
+#include <system_error>
+
+#include "linux/PlainText.h"
+
+namespace tessel {
+
+namespace {
+
+// A year: longer waits are typing mistakes, and every sum of times stays far from overflow.
+constexpr int64_t kMaxSeconds = 365 * 86'400;
+constexpr size_t kMaxQuotedValue = 256;
+
+std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
+  int64_t seconds = 0;
+  const char* end = text.data() + text.size();
+  const auto [stopped, error] = std::from_chars(text.data(), end, seconds);
+  if (error != std::errc() || stopped != end || seconds < 1 || seconds > kMaxSeconds) return {};
+  return std::chrono::seconds{seconds};
+}
+
+std::string_view trimmed(std::string_view word) {
+  const size_t begin = word.find_first_not_of(" \t");
+  if (begin == std::string_view::npos) return {};
+  return word.substr(begin, word.find_last_not_of(" \t") - begin + 1);
+}
+
+bool enableSource(DeferSources& sources, std::string_view word) {
+  if (word == "file") return sources.file = true;
+  if (word == "battery") return sources.battery = true;
+  if (word == "pressure") return sources.pressure = true;
+  return false;
+}
+
+std::optional<DeferSources> deferSources(std::string_view list) {
+  DeferSources sources;
+  if (trimmed(list).empty()) return sources;
+  for (;;) {
+    const size_t comma = list.find(',');
+    if (!enableSource(sources, trimmed(list.substr(0, comma)))) return {};
+    if (comma == std::string_view::npos) return sources;
+    list.remove_prefix(comma + 1);
+  }
+}
+
+// The first of the directories that the service manager made for the service.
+std::optional<std::string> managedDirectory(const EnvironmentReader& environment,
+                                            const std::string& name) {
+  const std::optional<std::string> list = environment(name);
+  if (!list) return {};
+  std::string first = list->substr(0, list->find(':'));
+  if (first.empty()) return {};
+  return first;
+}
+
+// Reads the variables one after another and remembers the first that makes no sense.
+class VariableReader {
+ public:
+  explicit VariableReader(const EnvironmentReader& environment) : environment_(environment) {}
+
+  // Gives `target` the value that `parse` makes of the variable, where it is set.
+  template <typename Target, typename Parse>
+  void read(const std::string& variable, Target& target, const char* expected, Parse parse) {
+    const std::optional<std::string> text = environment_(variable);
+    if (!text) return;
+    if (auto value = parse(std::string_view(*text))) {
+      target = *value;
+    } else if (!error_) {
+      error_ = LaunchError{variable, *text, expected};
+    }
+  }
+  void readPath(const std::string& variable, auto& target) {
+    read(variable, target, "a path", [](std::string_view text) {
+      return text.empty() ? std::nullopt : std::optional(std::string(text));
+    });
+  }
+  const std::optional<LaunchError>& error() const { return error_; }
+
+ private:
+  const EnvironmentReader& environment_;
+  std::optional<LaunchError> error_;
+};
+
+std::optional<LogDestination> logDestination(std::string_view text) {
+  if (text == "journal") return LogDestination::journal;
+  if (text == "stderr") return LogDestination::standardError;
+  return {};
+}
+
+std::optional<LogLevel> logLevel(std::string_view text) {
+  if (text == "error") return LogLevel::error;
+  if (text == "debug") return LogLevel::debug;
+  return {};
+}
+
+}  // namespace
+
+std::string LaunchError::line() const {
+  std::string shown = value.substr(0, kMaxQuotedValue);
+  if (shown.size() < value.size()) shown += "...";
+  return "tessel_reporter: " + variable + "=\"" + plainText(shown, "\\x0a") +
+         "\" makes no sense: expected " + expected;
+}
+
+std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
+    const EnvironmentReader& environment) {
+  constexpr const char* kSeconds = "a whole number of seconds from 1 to 31536000";
+  LaunchConfiguration configuration;
+  if (auto managed = managedDirectory(environment, "STATE_DIRECTORY")) {
+    configuration.stateDirectory = *managed;
+  }
+  if (auto managed = managedDirectory(environment, "CONFIGURATION_DIRECTORY")) {
+    configuration.configurationDirectory = *managed;
+  }
+  VariableReader variables(environment);
+  variables.readPath("TESSEL_TRACE_STORE", configuration.traceStore);
+  variables.readPath("TESSEL_STATE_DIR", configuration.stateDirectory);
+  variables.readPath("TESSEL_CONFIG_DIR", configuration.configurationDirectory);
+  variables.read("TESSEL_ACTIVITY_INTERVAL", configuration.activityInterval, kSeconds,
+                 wholeSeconds);
+  variables.read("TESSEL_DEFER_RETRY", configuration.deferRetry, kSeconds, wholeSeconds);
+  variables.read("TESSEL_DEFER_ON", configuration.deferOn,
+                 "a comma-separated list of file, battery and pressure, or nothing", deferSources);
+  variables.read("TESSEL_LOG", configuration.logDestination, "journal or stderr", logDestination);
+  variables.read("TESSEL_LOG_LEVEL", configuration.logLevel, "error or debug", logLevel);
+  variables.readPath("TESSEL_OS_RELEASE", configuration.osReleasePath);
+  if (variables.error()) return *variables.error();
+  return configuration;
+}
+
+EnvironmentReader processEnvironment() {
+  return [](const std::string& name) -> std::optional<std::string> {
+    const char* value =
+        std::getenv(name.c_str());  // NOLINT(concurrency-mt-unsafe): nobody sets variables
+    if (!value) return {};
+    return value;
+  };
+}
+
+}  // namespace tessel

@@ -1,0 +1,15 @@
+// Text of unknown origin made fit for a terminal.
+
+#pragma once
+
+#include <string>
+#include <string_view>
+
+namespace tessel {
+
+// `text` with every control character and every byte that is not part of well-formed UTF-8 written
+// as \xNN, so that it can neither move a cursor nor start a line. Tabs stay; a line feed becomes
+// `lineFeed`.
+std::string plainText(std::string_view text, std::string_view lineFeed);
+
+}  // namespace tessel

@@ -1,0 +1,99 @@
+// The state directory on disk.
+
+#include "linux/StateDirectory.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstdio>
+#include <filesystem>
+#include <system_error>
+
+#include "linux/Files.h"
+#include "linux/PlainText.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr mode_t kDirectoryMode = 0750;
+constexpr mode_t kFileMode = 0640;
+constexpr size_t kMaxRecordSize = 64;
+
+// Makes the directory and what is missing above it; the errno of what went wrong, or 0.
+int makeDirectory(const std::string& path) {
+  const std::filesystem::path parent = std::filesystem::path(path).parent_path();
+  std::error_code error;
+  if (!parent.empty()) std::filesystem::create_directories(parent, error);
+  if (error) return error.value();
+  if (::mkdir(path.c_str(), kDirectoryMode) == 0) return 0;
+  struct stat facts {};
+  if (errno != EEXIST || ::stat(path.c_str(), &facts) != 0) return errno;
+  return S_ISDIR(facts.st_mode) ? 0 : ENOTDIR;
+}
+
+UniqueFd openLockFile(const std::string& directory) {
+  const std::string path = directory + "/lock";
+  return UniqueFd(
+      ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, kFileMode));
+}
+
+// An error of the last system call on `path`, in words.
+std::string lastError(const std::string& path) { return path + ": " + errorWords(errno); }
+
+std::optional<std::string> writeDurably(const std::string& path, const std::string& text) {
+  const UniqueFd file(
+      ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, kFileMode));
+  if (!file.valid() || !writeAll(file.get(), text) || ::fsync(file.get()) != 0)
+    return lastError(path);
+  return {};
+}
+
+}  // namespace
+
+std::variant<StateDirectory, std::string> StateDirectory::open(const std::string& path) {
+  const std::string shown = "state directory " + plainText(path, "\\x0a") + ": ";
+  if (const int error = makeDirectory(path)) return shown + errorWords(error);
+  if (!openLockFile(path).valid())
+    return shown + "cannot open its file \"lock\": " + errorWords(errno);
+  return StateDirectory(path);
+}
+
+std::optional<RunLock> StateDirectory::lock(int operation) const {
+  UniqueFd file = openLockFile(path_);
+  if (!file.valid()) return {};
+  while (::flock(file.get(), operation) != 0) {
+    if (errno != EINTR) return {};
+  }
+  return RunLock(std::move(file));
+}
+
+std::optional<RunLock> StateDirectory::tryLock() const { return lock(LOCK_EX | LOCK_NB); }
+
+std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX); }
+
+std::optional<Date> StateDirectory::lastRun() const {
+  const std::optional<std::string> text = readSmallFile(recordFile(), kMaxRecordSize);
+  if (!text || !text->ends_with('\n')) return {};
+  int64_t microseconds = 0;
+  const char* end = text->data() + text->size() - 1;
+  const auto [stopped, error] = std::from_chars(text->data(), end, microseconds);
+  if (error != std::errc() || stopped != end || microseconds < 0) return {};
+  return Date(std::chrono::microseconds{microseconds});
+}
+
+std::optional<std::string> StateDirectory::recordRun(Date begin) const {
+  const std::string fresh = recordFile() + ".new";
+  if (auto error = writeDurably(fresh, std::to_string(begin.time_since_epoch().count()) + '\n'))
+    return error;
+  if (std::rename(fresh.c_str(), recordFile().c_str()) != 0) return lastError(recordFile());
+  const UniqueFd directory(::open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!directory.valid() || ::fsync(directory.get()) != 0) return lastError(path_);
+  return {};
+}
+
+}  // namespace tessel

@@ -1,0 +1,60 @@
+// StateDirectory: the directory for what outlives the process, and the scheduler's files in it.
+//
+//   lock                held with flock() by the process that has a run, for as long as it has it;
+//                       always empty
+//   scheduler-last-run  when the last run began: microseconds since 1970 in decimal and a line
+//                       feed; replaced as a whole, by the holder of the lock only
+//   defer               made and removed by others: while anything is there, runs are deferred
+//
+// Immutable once opened; any thread may use it.
+
+#pragma once
+
+#include <optional>
+#include <string>
+#include <utility>
+#include <variant>
+
+#include "linux/UniqueFd.h"
+#include "platform/Clock.h"
+
+namespace tessel {
+
+// Holds the right to run until it is destroyed or the process ends.
+class RunLock {
+ public:
+  explicit RunLock(UniqueFd file) : file_(std::move(file)) {}
+
+ private:
+  UniqueFd file_;  // closing it releases the lock
+};
+
+class StateDirectory {
+ public:
+  // Makes the directory (mode 0750) where it is missing. The error is one line that names the
+  // directory and what is wrong with it: it cannot be made, is none, or cannot be written to.
+  static std::variant<StateDirectory, std::string> open(const std::string& path);
+
+  const std::string& path() const { return path_; }
+  std::string deferFile() const { return path_ + "/defer"; }
+
+  // The right to run; nothing where another holder has it.
+  std::optional<RunLock> tryLock() const;
+  // Waits for the right to run. Nothing where the lock file cannot be opened or locked.
+  std::optional<RunLock> waitForLock() const;
+
+  // When the last run began; nothing where none is recorded or the record cannot be understood.
+  std::optional<Date> lastRun() const;
+  // Records a run. The reason in words where that fails; an earlier record then still stands.
+  // REQUIRES: the caller holds the lock.
+  std::optional<std::string> recordRun(Date begin) const;
+
+ private:
+  explicit StateDirectory(std::string path) : path_(std::move(path)) {}
+  std::optional<RunLock> lock(int operation) const;
+  std::string recordFile() const { return path_ + "/scheduler-last-run"; }
+
+  std::string path_;
+};
+
+}  // namespace tessel

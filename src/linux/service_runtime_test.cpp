@@ -1,0 +1,156 @@
+// When the process may end, what the service manager hears, and interrupts.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+#include <cstdlib>
+
+#include "linux/ProcessSetup.h"
+#include "linux/ServiceManager.h"
+#include "linux/ServiceRuntime.h"
+#include "platform/WorkerQueue.h"
+#include "platform/testing/Fakes.h"
+
+namespace tessel {
+namespace {
+
+using ::testing::ElementsAre;
+using testing::FakeClock;
+
+class ServiceManagerTest : public ::testing::Test {
+ protected:
+  ServiceManager::Notify remember() {
+    return [this](const std::string& message) { messages_.push_back(message); };
+  }
+
+  FakeClock clock_;
+  std::vector<std::string> messages_;
+};
+
+TEST_F(ServiceManagerTest, StatusIsOneLineAndNotRepeated) {
+  ServiceManager manager(clock_, remember(), {});
+  manager.ready();
+  manager.say("reading");
+  manager.say("reading");
+  manager.say("two\nlines");
+  manager.stopping();
+  EXPECT_THAT(messages_,
+              ElementsAre("READY=1", "STATUS=reading", "STATUS=two lines", "STOPPING=1"));
+}
+
+TEST_F(ServiceManagerTest, ProgressFeedsTheWatchdogFourTimesPerPeriod) {
+  ServiceManager manager(clock_, remember(), std::chrono::seconds{8});
+  for (int millisecond = 0; millisecond < 8000; ++millisecond) {
+    manager.progress();
+    clock_.advance(std::chrono::milliseconds{1});
+  }
+  EXPECT_EQ(messages_, std::vector<std::string>(4, "WATCHDOG=1"));
+}
+
+TEST_F(ServiceManagerTest, NobodyIsFedWithoutAWatchdog) {
+  ServiceManager manager(clock_, remember(), {});
+  manager.progress();
+  EXPECT_TRUE(messages_.empty());
+}
+
+class ServiceRuntimeTest : public ::testing::Test {
+ protected:
+  FakeClock clock_;
+  ServiceManager manager_{clock_, [](const std::string&) {}, {}};
+  ServiceRuntime runtime_{manager_};
+};
+
+TEST_F(ServiceRuntimeTest, TheProcessMayEndOnlyWhenAskedToAndNothingIsOpenOrPending) {
+  auto outer = runtime_.openTransaction("outer");
+  auto inner = runtime_.openTransaction("inner");
+  auto delivery = runtime_.expectDelivery();
+  inner.reset();
+  runtime_.requestCleanExit();
+  EXPECT_FALSE(runtime_.mayExit());
+  outer.reset();
+  EXPECT_FALSE(runtime_.mayExit()) << "a delivery is pending";
+  delivery.reset();
+  EXPECT_TRUE(runtime_.mayExit());
+  outer = runtime_.openTransaction("again");
+  EXPECT_FALSE(runtime_.mayExit());
+  outer.reset();
+  EXPECT_TRUE(runtime_.mayExit()) << "the request stays in force";
+}
+
+TEST_F(ServiceRuntimeTest, NoRequestNoEnd) {
+  runtime_.openTransaction("work").reset();
+  EXPECT_FALSE(runtime_.mayExit());
+}
+
+// The rest ends processes: each case runs in one of its own.
+class ProcessEndTest : public ServiceRuntimeTest {
+ protected:
+  ProcessEndTest() { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+};
+
+TEST_F(ProcessEndTest, TheMainLoopEndsTheProcessWhenTheLastTransactionCloses) {
+  EXPECT_EXIT(
+      {
+        WorkerQueue queue("test");
+        auto transaction = std::make_shared<std::unique_ptr<KeepAliveTransaction>>(
+            runtime_.openTransaction("work"));
+        queue.async([this, transaction] {
+          runtime_.requestCleanExit();
+          transaction->reset();
+        });
+        runtime_.runMainLoop();
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ProcessEndTest, AnInterruptBeforeTheSourceIsResumedIsDeliveredOnceItIs) {
+  EXPECT_EXIT(
+      {
+        prepareProcess();
+        ::kill(::getpid(), SIGINT);
+        WorkerQueue working("other work");
+        std::atomic<int> turns{0};
+        working.async([&turns] {
+          for (;;) ++turns;
+        });
+        const auto queue = std::make_shared<WorkerQueue>("interrupts");
+        const auto source = runtime_.makeSignalSource(SIGINT, queue);
+        source->setHandler([] { std::exit(0); });  // NOLINT(concurrency-mt-unsafe)
+        source->resume();
+        runtime_.runMainLoop();
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ProcessEndTest, AnInterruptThatIsIgnoredByInheritanceStillEndsTheProcess) {
+  EXPECT_EXIT(
+      {
+        std::signal(SIGINT, SIG_IGN);
+        prepareProcess();
+        const auto source =
+            runtime_.makeSignalSource(SIGINT, std::make_shared<WorkerQueue>("interrupts"));
+        source->setHandler([] { std::exit(0); });  // NOLINT(concurrency-mt-unsafe)
+        source->resume();
+        ::kill(::getpid(), SIGINT);
+        runtime_.runMainLoop();
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ProcessEndTest, ClosedStandardDescriptorsAreTakenBeforeAFileTakesThem) {
+  EXPECT_EXIT(
+      {
+        ::close(0);
+        ::close(1);
+        prepareProcess();
+        const int next = ::dup(2);
+        _exit(next > 2 ? 0 : 1);
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+}  // namespace
+}  // namespace tessel
