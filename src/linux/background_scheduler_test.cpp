@@ -1,0 +1,296 @@
+// Check-in, runs, deferrals, and one run at a time.
+
+#include "linux/BackgroundScheduler.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <mutex>
+#include <stdexcept>
+#include <thread>
+
+#include "linux/RunSchedule.h"
+#include "linux/testing/TemporaryDirectory.h"
+#include "platform/testing/Fakes.h"
+
+namespace tessel {
+namespace {
+
+using std::chrono::hours;
+using std::chrono::nanoseconds;
+using std::chrono::seconds;
+using ::testing::ElementsAre;
+using testing::FakeClock;
+using testing::FakeServiceStatus;
+using testing::TemporaryDirectory;
+
+const Date kNoon{seconds{1'795'000'000}};
+
+TEST(WaitForRunTest, NoWaitExceedsTheIntervalHoweverTheWallClockStands) {
+  const struct {
+    const char* what;
+    std::optional<Date> lastRun;
+    nanoseconds waited;
+    nanoseconds expected;
+  } kCases[] = {
+      {"never run", {}, seconds{0}, seconds{0}},
+      {"just run", kNoon, seconds{0}, hours{24}},
+      {"half way", kNoon - hours{12}, seconds{0}, hours{12}},
+      {"a microsecond early", kNoon - hours{24} + std::chrono::microseconds{1}, seconds{0},
+       std::chrono::microseconds{1}},
+      {"due", kNoon - hours{24}, seconds{0}, seconds{0}},
+      {"long due", Date{}, seconds{0}, seconds{0}},
+      {"clock set back before the wait", kNoon + hours{24 * 365}, seconds{0}, hours{24}},
+      {"clock set back, some waited", kNoon + hours{24 * 365}, hours{20}, hours{4}},
+      {"clock set back, all waited", kNoon + hours{24 * 365}, hours{25}, seconds{0}},
+      {"clock set back a little during the wait", kNoon - hours{1}, hours{22}, hours{2}},
+  };
+  for (const auto& [what, lastRun, waited, expected] : kCases) {
+    EXPECT_EQ(waitForRun(lastRun, kNoon, hours{24}, waited), expected) << what;
+  }
+}
+
+class StateDirectoryTest : public ::testing::Test {
+ protected:
+  static StateDirectory opened(const std::string& path) {
+    auto result = StateDirectory::open(path);
+    if (const auto* error = std::get_if<std::string>(&result)) throw std::runtime_error(*error);
+    return std::get<StateDirectory>(result);
+  }
+
+  TemporaryDirectory temporary_;
+  StateDirectory state_ = opened(temporary_.path("deep/state"));
+};
+
+TEST_F(StateDirectoryTest, IsMadeForItsOwnerAndGroupAndKeptWhenItIsThere) {
+  struct stat facts {};
+  ASSERT_EQ(::stat(state_.path().c_str(), &facts), 0);
+  EXPECT_EQ(facts.st_mode & 07777 & ~0750u, 0u);
+  state_.recordRun(kNoon);
+  EXPECT_EQ(opened(state_.path() + "/").lastRun(), kNoon);
+}
+
+TEST_F(StateDirectoryTest, AnUnusableOneIsNamedWithTheReason) {
+  const auto errorOf = [](const std::string& path) {
+    const auto result = StateDirectory::open(path);
+    return std::holds_alternative<std::string>(result) ? std::get<std::string>(result) : "opened";
+  };
+  const std::string file = temporary_.write("file", "");
+  EXPECT_EQ(errorOf(file), "state directory " + file + ": Not a directory");
+  EXPECT_EQ(errorOf(file + "/state"), "state directory " + file + "/state: Not a directory");
+  EXPECT_EQ(errorOf("/proc/tessel"), "state directory /proc/tessel: No such file or directory");
+  std::filesystem::create_directories(temporary_.path("taken/lock"));
+  EXPECT_THAT(errorOf(temporary_.path("taken")), ::testing::HasSubstr("\"lock\": Is a directory"));
+}
+
+TEST_F(StateDirectoryTest, OneHolderOfTheLockAtATime) {
+  std::optional<RunLock> first = state_.tryLock();
+  ASSERT_TRUE(first);
+  EXPECT_FALSE(opened(state_.path()).tryLock());
+  first.reset();
+  EXPECT_TRUE(opened(state_.path()).waitForLock());
+}
+
+TEST_F(StateDirectoryTest, TheRecordIsReplacedAsAWholeAndNonsenseIsNone) {
+  EXPECT_EQ(state_.lastRun(), std::nullopt);
+  EXPECT_EQ(state_.recordRun(kNoon - hours{24}), std::nullopt);
+  EXPECT_EQ(state_.recordRun(kNoon), std::nullopt);
+  EXPECT_EQ(temporary_.read("deep/state/scheduler-last-run"), "1795000000000000\n");
+  EXPECT_EQ(state_.lastRun(), kNoon);
+  for (const char* record : {"", "\n", "17", "soon\n", "-5\n", "17 \n", "99999999999999999999\n"}) {
+    temporary_.write("deep/state/scheduler-last-run", record);
+    EXPECT_EQ(state_.lastRun(), std::nullopt) << record;
+  }
+  std::filesystem::create_directory(state_.path() + "/scheduler-last-run.new");
+  EXPECT_EQ(state_.recordRun(kNoon), state_.path() + "/scheduler-last-run.new: Is a directory");
+}
+
+// A scheduler's deliveries on the test's own thread, with a clock that jumps over every wait.
+class ActivityDeliveriesTest : public StateDirectoryTest {
+ protected:
+  ActivityDeliveries deliveries(ScheduleCriteria criteria) {
+    return {criteria,
+            state_,
+            conditions_,
+            status_,
+            clock_,
+            [this](const std::shared_ptr<Activity>& activity) {
+              begins_.push_back(clock_.now());
+              states_.push_back(activity->state());
+              latest_ = activity;
+              if (handle_) handle_(*activity);
+            }};
+  }
+  void wantDeferral() { temporary_.write("deep/state/defer", ""); }
+  void wantNoDeferral() { std::filesystem::remove(temporary_.path("deep/state/defer")); }
+
+  FakeClock clock_;
+  FakeServiceStatus status_;
+  DeferralConditions conditions_{{true, false, false}, state_.deferFile()};
+  std::function<void(Activity&)> handle_;
+  std::vector<Date> begins_;
+  std::vector<int64_t> states_;
+  std::shared_ptr<Activity> latest_;
+};
+
+TEST_F(ActivityDeliveriesTest, WithoutAnIntervalOneRunFollowsTheCheckInAtOnce) {
+  state_.recordRun(clock_.now());
+  ActivityDeliveries once = deliveries({});
+  once.deliverCheckIn();
+  EXPECT_FALSE(once.deliverRun());
+  EXPECT_THAT(states_, ElementsAre(0, 2));
+  EXPECT_TRUE(clock_.waits.empty());
+}
+
+TEST_F(ActivityDeliveriesTest, WithAnIntervalARunComesThatLongAfterTheLastOneBegan) {
+  state_.recordRun(clock_.now() - hours{23});
+  const Date start = clock_.now();
+  handle_ = [&](Activity&) { clock_.advance(std::chrono::minutes{10}); };
+  ActivityDeliveries daily = deliveries({hours{24}, seconds{900}});
+  EXPECT_TRUE(daily.deliverRun());
+  EXPECT_TRUE(daily.deliverRun());
+  EXPECT_THAT(begins_, ElementsAre(start + hours{1}, start + hours{25}));
+  EXPECT_EQ(state_.lastRun(), start + hours{25});
+}
+
+TEST_F(ActivityDeliveriesTest, AClockSetBackDelaysARunByAnIntervalAtMost) {
+  state_.recordRun(clock_.now() + hours{24 * 365});
+  const Date start = clock_.now();
+  ActivityDeliveries daily = deliveries({hours{24}, seconds{900}});
+  daily.deliverRun();
+  daily.deliverRun();
+  EXPECT_THAT(begins_, ElementsAre(start + hours{24}, start + hours{48}));
+}
+
+TEST_F(ActivityDeliveriesTest, ARunOfAnotherProcessDuringTheWaitStartsTheWaitAgain) {
+  state_.recordRun(clock_.now());
+  const Date otherRun = clock_.now() + hours{20};
+  clock_.whileWaiting = [&] {
+    if (clock_.now() == otherRun) state_.recordRun(otherRun);
+  };
+  ActivityDeliveries daily = deliveries({hours{24}, seconds{900}});
+  daily.deliverRun();
+  EXPECT_THAT(begins_, ElementsAre(otherRun + hours{24}));
+}
+
+TEST_F(ActivityDeliveriesTest, ARunThatCannotBeRecordedIsSaidAndNotRepeatedAtOnce) {
+  const testing::RecordingLog log(LogLevel::error);
+  std::filesystem::create_directory(state_.path() + "/scheduler-last-run.new");
+  ActivityDeliveries hourly = deliveries({hours{1}, seconds{900}});
+  hourly.deliverRun();
+  hourly.deliverRun();
+  EXPECT_EQ(begins_[1] - begins_[0], hours{1});
+  EXPECT_THAT(log.errors(), ::testing::Each(::testing::StartsWith("Could not record the run: ")));
+  EXPECT_EQ(log.errors().size(), 2u);
+}
+
+TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgainAfterTheRetryTimeAndNotRecorded) {
+  wantDeferral();
+  handle_ = [](Activity& activity) {
+    if (!activity.shouldDefer()) return;
+    EXPECT_TRUE(activity.setState(kActivityStateDefer));
+  };
+  const Date start = clock_.now();
+  ActivityDeliveries once = deliveries({{}, seconds{900}});
+  EXPECT_TRUE(once.deliverRun());
+  EXPECT_EQ(state_.lastRun(), std::nullopt);
+  EXPECT_TRUE(state_.tryLock()) << "a deferred run holds up nobody";
+  wantNoDeferral();
+  EXPECT_FALSE(once.deliverRun());
+  EXPECT_THAT(begins_, ElementsAre(start, start + seconds{900}));
+  EXPECT_EQ(state_.lastRun(), start + seconds{900});
+}
+
+TEST_F(ActivityDeliveriesTest, OnlyDeferIsTakenOnlyOnceAndOnlyDuringARun) {
+  handle_ = [](Activity& activity) {
+    for (const int64_t state : {0, 1, 2, 4, 5, -1}) EXPECT_FALSE(activity.setState(state)) << state;
+    const bool isRun = activity.state() == kActivityStateRun;
+    EXPECT_EQ(activity.setState(3), isRun);
+    EXPECT_FALSE(activity.setState(3));
+  };
+  ActivityDeliveries once = deliveries({});
+  once.deliverCheckIn();
+  EXPECT_EQ(latest_->state(), 0);
+  EXPECT_TRUE(once.deliverRun());
+  EXPECT_EQ(latest_->state(), 3);
+  handle_ = nullptr;
+  EXPECT_FALSE(once.deliverRun());
+  EXPECT_FALSE(latest_->setState(3)) << "the run is over";
+  EXPECT_EQ(latest_->state(), 2);
+}
+
+TEST_F(ActivityDeliveriesTest, TheHandlerRunsUnderTheLock) {
+  handle_ = [&](Activity& activity) {
+    EXPECT_EQ(state_.tryLock().has_value(), activity.state() == 0);
+  };
+  ActivityDeliveries once = deliveries({});
+  once.deliverCheckIn();
+  once.deliverRun();
+  EXPECT_TRUE(state_.tryLock());
+}
+
+// Tells a test, which waits on it, when the scheduler waits for somebody else's run.
+struct SignallingStatus final : ServiceStatus {
+  void say(std::string_view words) override {
+    if (words == "waiting for the run of another process") waitsForOther.signal();
+  }
+  void progress() override {}
+  Semaphore waitsForOther{0};
+};
+
+TEST_F(ActivityDeliveriesTest, ASecondProcessGetsItsRunWhenTheFirstIsDone) {
+  SignallingStatus status;
+  std::mutex mutex;
+  std::vector<std::string> order;
+  const auto note = [&](const char* what) {
+    const std::lock_guard lock(mutex);
+    order.emplace_back(what);
+  };
+  std::optional<RunLock> first = state_.tryLock();
+  ActivityDeliveries second({}, state_, conditions_, status, clock_,
+                            [&](const std::shared_ptr<Activity>&) { note("second runs"); });
+  std::thread thread([&] { second.deliverRun(); });
+  EXPECT_TRUE(status.waitsForOther.waitFor(seconds{30}));
+  note("first done");
+  first.reset();
+  thread.join();
+  EXPECT_THAT(order, ElementsAre("first done", "second runs"));
+}
+
+TEST_F(ActivityDeliveriesTest, ASecondProcessWithAnIntervalDoesNotRepeatTheRunOfTheFirst) {
+  SignallingStatus status;
+  std::optional<RunLock> first = state_.tryLock();
+  const Date start = clock_.now();
+  ActivityDeliveries second(
+      {hours{24}, seconds{900}}, state_, conditions_, status, clock_,
+      [&](const std::shared_ptr<Activity>&) { begins_.push_back(clock_.now()); });
+  std::thread thread([&] { second.deliverRun(); });
+  EXPECT_TRUE(status.waitsForOther.waitFor(seconds{30}));
+  state_.recordRun(start);
+  first.reset();
+  thread.join();
+  EXPECT_THAT(begins_, ElementsAre(start + hours{24}));
+}
+
+TEST_F(ActivityDeliveriesTest, TheProcessMayNotEndBeforeTheLastDeliveryIsOver) {
+  ServiceManager manager(clock_, [](const std::string&) {}, {});
+  ServiceRuntime runtime(manager);
+  BackgroundScheduler scheduler({}, state_, conditions_, runtime, manager, clock_);
+  Semaphore mayRun(0);
+  Semaphore ran(0);
+  runtime.requestCleanExit();
+  scheduler.registerActivity("test", [&](const std::shared_ptr<Activity>& activity) {
+    if (activity->state() != kActivityStateRun) return;
+    EXPECT_TRUE(mayRun.waitFor(seconds{30}));
+    ran.signal();
+  });
+  EXPECT_FALSE(runtime.mayExit());
+  mayRun.signal();
+  EXPECT_TRUE(ran.waitFor(seconds{30}));
+  while (!runtime.mayExit()) std::this_thread::yield();
+}
+
+}  // namespace
+}  // namespace tessel
