@@ -21,16 +21,24 @@ void sendNamedPayloadEvent(EventSender& sender, const TesselObject& object,
 
 }  // namespace
 
+std::optional<Payload> reportPayload(const TesselObject& object, ProcessIdentity& identity,
+                                     const BootVolumeFacts& bootVolume) {
+  std::optional<Payload> payload = object.statoraPayload(identity);
+  if (payload) {
+    payload->set("BootPartitionFS", bootVolume.filesystem);
+    payload->set("BootDiskType", bootVolume.disk);
+  }
+  return payload;
+}
+
 bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject>& object) {
   if (!filter_->shouldReportTesselObject(*object, nullptr)) return true;
-  std::optional<Payload> payload = object->statoraPayload(road_.identity);
+  std::optional<Payload> payload = reportPayload(*object, road_.identity, bootVolume_);
   if (!payload) {
     tesselReporterLog().debug("Failed to create payload for %@/%@%@", object->subsystem(),
                               object->category(), object->name());
     return true;
   }
-  payload->set("BootPartitionFS", bootFilesystem_);
-  payload->set("BootDiskType", bootDisk_);
   send(object, std::make_shared<const Payload>(*std::move(payload)));
   return true;
 }

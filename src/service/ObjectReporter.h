@@ -7,6 +7,7 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/ProcessIdentity.h"
@@ -25,6 +26,16 @@ struct EventRoad {
   SerialQueue& reportingQueue;
 };
 
+// What is known of the boot volume; the filesystem may be absent.
+struct BootVolumeFacts {
+  SharedString filesystem;
+  SharedString disk;
+};
+
+// The payload that is sent for a reportable object; nothing where one cannot be made.
+std::optional<Payload> reportPayload(const TesselObject& object, ProcessIdentity& identity,
+                                     const BootVolumeFacts& bootVolume);
+
 class ObjectReporter {
  public:
   // `bootFilesystem` may be absent.
@@ -32,8 +43,7 @@ class ObjectReporter {
                  SharedString bootFilesystem, SharedString bootDisk)
       : road_(road),
         filter_(std::move(filter)),
-        bootFilesystem_(std::move(bootFilesystem)),
-        bootDisk_(std::move(bootDisk)) {}
+        bootVolume_{std::move(bootFilesystem), std::move(bootDisk)} {}
 
   // Always true.
   bool reportTesselObject(const std::shared_ptr<const TesselObject>& object);
@@ -44,8 +54,7 @@ class ObjectReporter {
 
   const EventRoad road_;
   const std::shared_ptr<TesselReporterObjectFilter> filter_;
-  const SharedString bootFilesystem_;
-  const SharedString bootDisk_;
+  const BootVolumeFacts bootVolume_;
 };
 
 }  // namespace tessel
