@@ -1,7 +1,7 @@
 // TesselReporterAggregation: how many trace objects each (subsystem, category) pair contributed.
 //
 // A pair is counted without copying or hashing its texts: the key takes a share of the strings it
-// is given when the pair is new, and nothing after that. About 45 bytes per distinct pair.
+// is given when the pair is new, and nothing after that. At most 40 bytes per distinct pair.
 //
 // Threads: one at a time. Keys handed out are valid while the aggregation lives.
 

@@ -32,7 +32,7 @@ void setLabelled(Payload& payload, std::string_view labelKey, StringRef label,
 
 // A bundle identifier says more than the process name that the event carries, so it wins.
 SharedString processNameOf(const EmittingProcess& process, ProcessIdentity& identity) {
-  const SharedString bundleIdentifier = identity.bundleIdentifierForImagePath(process.imagePath);
+  SharedString bundleIdentifier = identity.bundleIdentifierForImagePath(process.imagePath);
   if (bundleIdentifier.present()) return bundleIdentifier;
   return process.name.present() ? SharedString(process.name) : unknownText();
 }

@@ -1,0 +1,167 @@
+// The payload of each kind of trace object, key by key.
+
+#include <gtest/gtest.h>
+
+#include "objects/ProcessIdentity.h"
+#include "objects/TesselReporterPlatform.h"
+#include "objects/testing/TestObjects.h"
+#include "platform/testing/Fakes.h"
+
+namespace tessel {
+namespace {
+
+using testing::makeAnimationInterval;
+using testing::makeEvent;
+using testing::makeInterval;
+using testing::makeObject;
+using testing::TestPoint;
+
+class StatoraReportingTest : public ::testing::Test {
+ protected:
+  std::string json(const TesselSupportObject& object) {
+    const auto payload = object.statoraPayload(identity);
+    return payload ? payloadJson(*payload) : "none";
+  }
+
+  testing::FakeBundles bundles;
+  ProcessIdentity identity{bundles};
+};
+
+TEST_F(StatoraReportingTest, EveryValueOfAnEventStandsUnderItsKeyInOrder) {
+  TestPoint point;
+  point.string1Name = "period";
+  point.string1Value = "week";
+  point.string2Name = "size";
+  point.string2Value = "small";
+  point.number1Name = "count";
+  point.number1Value = Number(uint64_t{18446744073709551615u});
+  point.number2Name = "share";
+  point.number2Value = Number(0.1);
+  point.durationSeconds = 0.1F;
+  point.beginProcessName = "Calendar";
+  const auto event = makeEvent(point);
+  EXPECT_EQ(
+      json(*event),
+      R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
+      R"("String1Name":"period","String1Value":"week","String2Name":"size","String2Value":"small",)"
+      R"("Number1Name":"count","Number1Value":18446744073709551615,)"
+      R"("Number2Name":"share","Number2Value":0.1,)"
+      R"("IntervalType":"Event","DurationInSeconds":0.1,"StartProcessName":"Calendar"})");
+  const auto payload = event->statoraPayload(identity);
+  EXPECT_TRUE(std::holds_alternative<float>(std::get<Number>(*payload->find("DurationInSeconds"))));
+}
+
+TEST_F(StatoraReportingTest, AbsentValuesAreLeftOutOrUnknown) {
+  TestPoint point;
+  point.subsystem = point.category = point.name = {};
+  // A value without its label, and a label without its value.
+  point.string1Value = "week";
+  point.string2Name = "size";
+  point.number1Value = Number(int64_t{1});
+  point.number2Name = "share";
+  EXPECT_EQ(json(*makeEvent(point)),
+            R"({"Name":"Unknown","String2Name":"size","Number2Name":"share",)"
+            R"("IntervalType":"Event","DurationInSeconds":0,"StartProcessName":"Unknown"})");
+  // And the other way round.
+  point = {};
+  point.string1Name = "period";
+  point.string2Value = "small";
+  point.number1Name = "count";
+  point.number2Value = Number(int64_t{1});
+  EXPECT_EQ(json(*makeObject(point)),
+            R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
+            R"("String1Name":"period","Number1Name":"count",)"
+            R"("IntervalType":"TesselObject","DurationInSeconds":0})");
+}
+
+TEST_F(StatoraReportingTest, OnlyKindsOfTracePointsCanBeReported) {
+  const TesselSupportObject support;
+  EXPECT_EQ(json(support), "none");
+  EXPECT_FALSE(support.canGenerateStatoraPayload());
+  EXPECT_FALSE(makeObject({})->canGenerateStatoraPayload());
+  EXPECT_TRUE(makeEvent({})->canGenerateStatoraPayload());
+  EXPECT_TRUE(makeInterval({})->canGenerateStatoraPayload());
+  EXPECT_TRUE(makeAnimationInterval({})->canGenerateStatoraPayload());
+}
+
+TEST_F(StatoraReportingTest, BeginAndEndOfAnIntervalAreNamedEachByItself) {
+  bundles.identifiers["/apps/Clock.app"] = "com.vantor.Clock";
+  TestPoint point;
+  point.beginImagePath = "/apps/Clock.app/Clock";
+  point.beginProcessName = "Clock";
+  point.endImagePath = "/usr/bin/clockd";
+  point.endProcessName = "clockd";
+  EXPECT_EQ(json(*makeInterval(point)),
+            R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
+            R"("IntervalType":"Interval","DurationInSeconds":0,)"
+            R"("StartProcessName":"com.vantor.Clock","EndProcessName":"clockd"})");
+  point.endProcessName = {};
+  point.frameRate = 59.94F;
+  EXPECT_EQ(
+      json(*makeAnimationInterval(point)),
+      R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
+      R"("IntervalType":"AnimationInterval","DurationInSeconds":0,)"
+      R"("StartProcessName":"com.vantor.Clock","EndProcessName":"Unknown","FrameRate":59.94})");
+}
+
+TEST_F(StatoraReportingTest, TheOverrideIsTakenWhereItIsMeant) {
+  const struct {
+    TestPoint::Text subsystem, category;
+    bool taken;
+  } cases[] = {{"com.vantor.morvald", "Any", true},
+               {"com.vantor.morvald", {}, true},
+               {"com.vantor.Harrowmere", "Snapshot", true},
+               {"com.vantor.Harrowmere", "snapshot", false},
+               {"com.vantor.Harrowmere", {}, false},
+               {"com.vantor.Morvald", "Snapshot", false},
+               {{}, "Snapshot", false}};
+  for (const auto& row : cases) {
+    const testing::RecordingLog log;
+    TestPoint point;
+    point.subsystem = row.subsystem;
+    point.category = row.category;
+    point.name = "Snapshot";
+    point.attributes = {{"Other", "com.vantor.Other"}, {"BundleIdOverride", "com.vantor.Guest"}};
+    point.beginImagePath = "/apps/Host.app/Host";
+    point.beginProcessName = point.endProcessName = "host";
+    bundles.asked.clear();
+    ProcessIdentity fresh(bundles);
+    const auto payload = makeAnimationInterval(point)->statoraPayload(fresh);
+    for (const auto* key : {"StartProcessName", "EndProcessName"}) {
+      EXPECT_EQ(std::get<SharedString>(*payload->find(key)).textOr(""),
+                row.taken ? "com.vantor.Guest" : "host");
+    }
+    const std::string message = row.subsystem.value_or("(null)") + "/" +
+                                row.category.value_or("(null)") +
+                                "/Snapshot: Overriding bundle ID to com.vantor.Guest";
+    EXPECT_EQ(log.count(message), row.taken ? 1u : 0u);
+    EXPECT_EQ(bundles.asked.empty(), row.taken);
+    EXPECT_EQ(payload->find("BundleIdOverride"), nullptr);
+  }
+}
+
+TEST_F(StatoraReportingTest, WithoutAnOverrideTheSubsystemAloneChangesNothing) {
+  TestPoint point;
+  point.subsystem = "com.vantor.morvald";
+  point.beginProcessName = "begin";
+  point.endProcessName = "end";
+  const auto payload = makeInterval(point)->statoraPayload(identity);
+  EXPECT_EQ(std::get<SharedString>(*payload->find("StartProcessName")).textOr(""), "begin");
+}
+
+TEST(TesselReporterPlatformTest, NamesAndCodesBelongTogether) {
+  for (uint64_t code = 0; code <= 5; ++code) {
+    const auto platform = static_cast<TesselReporterPlatform>(code);
+    EXPECT_EQ(platformFromName(SharedString(nameForPlatform(platform))), platform);
+  }
+  EXPECT_EQ(nameForPlatform(currentPlatform()), "Selvin");
+  EXPECT_EQ(nameForPlatform(TesselReporterPlatform::lumet), "Lumet");
+  EXPECT_EQ(nameForPlatform(static_cast<TesselReporterPlatform>(6)), "Unknown");
+  for (const char* name : {"selvin", "Selvin ", ""}) {
+    EXPECT_EQ(platformFromName(SharedString(name)), TesselReporterPlatform::unknown) << name;
+  }
+  EXPECT_EQ(platformFromName({}), TesselReporterPlatform::unknown);
+}
+
+}  // namespace
+}  // namespace tessel
