@@ -26,24 +26,19 @@ concept Described = requires(const T& thing) {
 template <typename T>
 consteval LogArgumentKind kindOf() {
   using Plain = std::remove_cvref_t<T>;
-  if constexpr (std::is_same_v<Plain, bool>) {
-    return LogArgumentKind::none;
+  constexpr bool isText = Described<Plain> || std::is_same_v<Plain, StringRef> ||
+                          std::is_same_v<Plain, SharedString> ||
+                          std::is_convertible_v<const Plain&, std::string_view>;
+  if constexpr (isText) {
+    return LogArgumentKind::text;
   } else if constexpr (std::is_floating_point_v<Plain>) {
     return LogArgumentKind::floating;
-  } else if constexpr (std::is_integral_v<Plain>) {
-    if constexpr (std::is_unsigned_v<Plain>) {
-      return sizeof(Plain) == 8   ? LogArgumentKind::unsigned64
-             : sizeof(Plain) == 4 ? LogArgumentKind::unsigned32
-                                  : LogArgumentKind::none;
-    } else {
-      return sizeof(Plain) == 8 ? LogArgumentKind::signed64 : LogArgumentKind::none;
-    }
-  } else if constexpr (Described<Plain> || std::is_same_v<Plain, StringRef> ||
-                       std::is_same_v<Plain, SharedString> ||
-                       std::is_convertible_v<const Plain&, std::string_view>) {
-    return LogArgumentKind::text;
-  } else {
+  } else if constexpr (!std::is_integral_v<Plain> || std::is_same_v<Plain, bool>) {
     return LogArgumentKind::none;
+  } else if constexpr (sizeof(Plain) == 8) {
+    return std::is_unsigned_v<Plain> ? LogArgumentKind::unsigned64 : LogArgumentKind::signed64;
+  } else {
+    return std::is_same_v<Plain, uint32_t> ? LogArgumentKind::unsigned32 : LogArgumentKind::none;
   }
 }
 

@@ -44,7 +44,7 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
 }
 
 void ObjectReporter::send(const std::shared_ptr<const TesselObject>& object,
-                          std::shared_ptr<const Payload> payload) {
+                          const std::shared_ptr<const Payload>& payload) {
   EventSender& sender = road_.sender;
   road_.throttle.throttleReportedEvent();
   road_.reportingQueue.async(

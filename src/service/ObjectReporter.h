@@ -50,7 +50,7 @@ class ObjectReporter {
 
  private:
   void send(const std::shared_ptr<const TesselObject>& object,
-            std::shared_ptr<const Payload> payload);
+            const std::shared_ptr<const Payload>& payload);
 
   const EventRoad road_;
   const std::shared_ptr<TesselReporterObjectFilter> filter_;

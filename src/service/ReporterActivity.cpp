@@ -10,7 +10,8 @@ namespace {
 constexpr char kTransactionName[] = "com.vantor.tessel.tessel_reporter_activity transaction";
 }
 
-void ReporterActivity::handleActivity(std::shared_ptr<Activity> activity) {
+void ReporterActivity::handleActivity(const std::shared_ptr<Activity>& changed) {
+  const std::shared_ptr<Activity> activity = changed;  // kept until the transaction is closed
   const auto transaction = runtime_.openTransaction(kTransactionName);
   const int64_t state = activity->state();
   if (state == kActivityStateRun) {

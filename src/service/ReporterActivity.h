@@ -17,7 +17,7 @@ class ReporterActivity {
   ReporterActivity(Runtime& runtime, ReportingRun& run) : runtime_(runtime), run_(run) {}
 
   // Called by the scheduler on a thread of its own, never twice at a time. Blocks for a whole run.
-  void handleActivity(std::shared_ptr<Activity> activity);
+  void handleActivity(const std::shared_ptr<Activity>& changed);
 
  private:
   void runOrDefer(const std::shared_ptr<Activity>& activity);

@@ -25,27 +25,39 @@ void pollDeferral(Activity& activity, std::atomic<bool>& interruptedByDeferral,
   tesselReporterLog().debug("Concluding processing due to deferral request");
 }
 
+RunReport endedWith(RunEnding ending) {
+  RunReport report;
+  report.ending = ending;
+  return report;
+}
+
 }  // namespace
 
 void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity) {
-  observer_.runReached("waiting for tasking");
-  RunReport ended;
-  if (!gate_.shouldReport()) {
-    ended.outcome = RunOutcome::notTasked;
-  } else if (cookie_.cookieFileExists()) {
+  const Date began = surroundings_.clock.now();
+  RunReport ended = attempt(activity);
+  ended.began = began;
+  ended.ended = surroundings_.clock.now();
+  surroundings_.status.say("idle");
+  runEnded_(ended);
+}
+
+RunReport ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
+  surroundings_.status.say("waiting for the tasking configuration");
+  if (!gate_.shouldReport()) return endedWith(RunEnding::notTasked);
+  if (cookie_.cookieFileExists()) {
     tesselReporterLog().debug("Bailing due to cookie file");
     cookie_.clearCookieFile();
-    ended.outcome = RunOutcome::bailedOut;
-  } else if (!cookie_.createCookieFile()) {
-    ended.outcome = RunOutcome::noMarker;
-  } else {
-    ended = report(activity);
-    cookie_.clearCookieFile();
+    return endedWith(RunEnding::bailedOut);
   }
-  observer_.runEnded(ended);
+  if (!cookie_.createCookieFile()) return endedWith(RunEnding::noMarker);
+  RunReport reported = report(activity);
+  cookie_.clearCookieFile();
+  return reported;
 }
 
 RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
+  RunReport report;
   Clock& clock = surroundings_.clock;
   const uint64_t startTime = clock.continuousTicks();
   const auto extractor = makeExtractor_();
@@ -56,19 +68,19 @@ RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   const Date startDate = clock.now() - kLookBack;
   const Date endDate = clock.now();
   startDeferralPoll(activity, interruptedByDeferral, extractor);
-  observer_.runReached("reading the trace store");
-  const bool processed = extract(*extractor, startDate, endDate);
-  observer_.runReached("summarising");
+  surroundings_.status.say("reading the trace store");
+  const auto failure = extract(*extractor, startDate, endDate);
+  surroundings_.status.say("summarising");
   road_.reportingQueue.sync([&] {
-    summary_.reportRunSummary(*filter, *extractor, startDate, endDate, *interruptedByDeferral,
-                              startTime);
+    report.countEvents = summary_.reportRunSummary(*filter, *extractor, startDate, endDate,
+                                                   *interruptedByDeferral, startTime);
   });
-  return {processed ? RunOutcome::completed : RunOutcome::extractionFailed,
-          startDate,
-          endDate,
-          filter,
-          extractor,
-          interruptedByDeferral->load()};
+  report.ending = failure ? RunEnding::extractionFailed : RunEnding::completed;
+  report.failure = failure.value_or("");
+  report.filter = filter;
+  report.extractor = extractor;
+  report.interruptedByDeferral = *interruptedByDeferral;
+  return report;
 }
 
 std::shared_ptr<ObjectReporter> ReportingRun::makeObjectReporter(
@@ -82,11 +94,11 @@ std::shared_ptr<ObjectReporter> ReportingRun::makeObjectReporter(
 
 void ReportingRun::installCallbacks(TesselSupportObjectExtractor& extractor,
                                     const std::shared_ptr<ObjectReporter>& reporter) {
-  const auto reportTesselObject =
-      [reporter, &observer = observer_](const std::shared_ptr<const TesselObject>& object) {
-        observer.objectDelivered();
-        return reporter->reportTesselObject(object);
-      };
+  const auto reportTesselObject = [reporter, &status = surroundings_.status](
+                                      const std::shared_ptr<const TesselObject>& object) {
+    status.progress();
+    return reporter->reportTesselObject(object);
+  };
   extractor.setIntervalCompletionProcessingBlock(reportTesselObject);
   extractor.setAnimationIntervalCompletionProcessingBlock(reportTesselObject);
   extractor.setEmitEventProcessingBlock(reportTesselObject);
@@ -105,12 +117,13 @@ void ReportingRun::startDeferralPoll(
       ->resume();
 }
 
-bool ReportingRun::extract(TesselSupportObjectExtractor& extractor, Date startDate, Date endDate) {
+std::optional<std::string> ReportingRun::extract(TesselSupportObjectExtractor& extractor,
+                                                 Date startDate, Date endDate) {
   std::optional<PlatformError> error;
-  if (extractor.processLogArchiveWithPath(std::nullopt, startDate, endDate, error)) return true;
-  tesselReporterLog().debug("Failed to process tessel data due to error: %@",
-                            error ? error->localizedDescription : std::string("Unknown error"));
-  return false;
+  if (extractor.processLogArchiveWithPath(std::nullopt, startDate, endDate, error)) return {};
+  std::string description = error ? error->localizedDescription : "Unknown error";
+  tesselReporterLog().debug("Failed to process tessel data due to error: %@", description);
+  return description;
 }
 
 }  // namespace tessel

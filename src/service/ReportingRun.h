@@ -9,13 +9,15 @@
 #include <atomic>
 #include <functional>
 #include <memory>
-#include <string_view>
+#include <optional>
+#include <string>
 
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Activity.h"
 #include "platform/Clock.h"
 #include "platform/SerialQueue.h"
+#include "platform/ServiceStatus.h"
 #include "platform/System.h"
 #include "service/CookieFile.h"
 #include "service/ObjectReporter.h"
@@ -25,30 +27,27 @@
 namespace tessel {
 
 // How a run ended.
-enum class RunOutcome { notTasked, bailedOut, noMarker, completed, extractionFailed };
+enum class RunEnding { notTasked, bailedOut, noMarker, completed, extractionFailed };
 
 // What is known of a run when it has ended. A run that read nothing has neither filter nor
 // extractor.
 struct RunReport {
-  RunOutcome outcome = RunOutcome::notTasked;
-  Date startDate{};  // of the period read
-  Date endDate{};
+  RunEnding ending = RunEnding::notTasked;
+  Date began{};
+  Date ended{};
+  std::string failure;  // why the extraction failed; empty where it did not
+  uint64_t countEvents = 0;
   std::shared_ptr<const TesselReporterObjectFilter> filter;
   std::shared_ptr<const TesselSupportObjectExtractor> extractor;
   bool interruptedByDeferral = false;
 };
 
-// Told of each run: what it is doing now, in a word or two, and how it ended.
-class RunObserver {
- public:
-  virtual ~RunObserver() = default;
-  virtual void runReached(std::string_view step) = 0;
-  virtual void objectDelivered() = 0;
-  virtual void runEnded(const RunReport& report) = 0;
-};
+// Told how each run ended, on the run's thread, after its last step.
+using RunEndedCallback = std::function<void(const RunReport&)>;
 
 // What a run asks of its surroundings besides the parts it is wired from.
 struct RunSurroundings {
+  ServiceStatus& status;
   QueueFactory& queues;
   Clock& clock;
   Volumes& volumes;
@@ -59,26 +58,29 @@ class ReportingRun {
  public:
   ReportingRun(TaskingGate& gate, CookieFile& cookie, const RunSurroundings& surroundings,
                ExtractorFactory makeExtractor, const EventRoad& road, RunSummary& summary,
-               RunObserver& observer)
+               RunEndedCallback runEnded)
       : gate_(gate),
         cookie_(cookie),
         surroundings_(surroundings),
         makeExtractor_(std::move(makeExtractor)),
         road_(road),
         summary_(summary),
-        observer_(observer) {}
+        runEnded_(std::move(runEnded)) {}
 
   void performReportingRun(const std::shared_ptr<Activity>& activity);
 
  private:
   using InterruptedCell = std::shared_ptr<std::atomic<bool>>;
 
+  RunReport attempt(const std::shared_ptr<Activity>& activity);
   RunReport report(const std::shared_ptr<Activity>& activity);
   std::shared_ptr<ObjectReporter> makeObjectReporter(
       const std::shared_ptr<TesselReporterObjectFilter>& filter);
   void installCallbacks(TesselSupportObjectExtractor& extractor,
                         const std::shared_ptr<ObjectReporter>& reporter);
-  bool extract(TesselSupportObjectExtractor& extractor, Date startDate, Date endDate);
+  // Why the extraction failed, in words; nothing where it did not.
+  std::optional<std::string> extract(TesselSupportObjectExtractor& extractor, Date startDate,
+                                     Date endDate);
   void startDeferralPoll(const std::shared_ptr<Activity>& activity,
                          const InterruptedCell& interruptedByDeferral,
                          const std::shared_ptr<TesselSupportObjectExtractor>& extractor);
@@ -89,7 +91,7 @@ class ReportingRun {
   const ExtractorFactory makeExtractor_;
   const EventRoad road_;
   RunSummary& summary_;
-  RunObserver& observer_;
+  const RunEndedCallback runEnded_;
 };
 
 }  // namespace tessel

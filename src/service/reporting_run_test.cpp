@@ -14,16 +14,6 @@ using testing::makeEvent;
 using testing::makeInterval;
 using testing::TestPoint;
 
-struct RememberingObserver final : RunObserver {
-  void runReached(std::string_view step) override { steps.emplace_back(step); }
-  void objectDelivered() override { ++delivered; }
-  void runEnded(const RunReport& report) override { reports.push_back(report); }
-
-  std::vector<std::string> steps;
-  size_t delivered = 0;
-  std::vector<RunReport> reports;
-};
-
 class ReportingRunTest : public ::testing::Test {
  protected:
   ReportingRunTest() { variant.internal = true; }
@@ -56,17 +46,22 @@ class ReportingRunTest : public ::testing::Test {
   testing::FakeDates dates;
   std::shared_ptr<testing::FakeExtractor> extractor = std::make_shared<testing::FakeExtractor>();
   std::shared_ptr<testing::FakeActivity> activity = std::make_shared<testing::FakeActivity>();
-  RememberingObserver observer;
+  testing::RememberingStatus status;
+  std::vector<RunReport> reports;
 
   TaskingGate gate{variant, configurations, queues, clock};
   CookieFile cookie{files};
   Throttle throttle{clock};
   ProcessIdentity identity{bundles};
-  RunSummary summary{sender, throttle, clock, dates};
+  RunSummary summary{sender, throttle, clock, dates, status};
   const EventRoad road{identity, throttle, sender, reportingQueue};
-  ReportingRun run{
-      gate,    cookie,  {queues, clock, volumes, variant}, [this] { return nextExtractor(); }, road,
-      summary, observer};
+  ReportingRun run{gate,
+                   cookie,
+                   {status, queues, clock, volumes, variant},
+                   [this] { return nextExtractor(); },
+                   road,
+                   summary,
+                   [this](const RunReport& report) { reports.push_back(report); }};
 };
 
 TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
@@ -85,7 +80,10 @@ TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
   EXPECT_EQ(extractor->endDate, clock.date);
   EXPECT_FALSE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(activity->statesSet.empty());
-  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::completed);
+  EXPECT_EQ(reports.at(0).ending, RunEnding::completed);
+  EXPECT_EQ(status.words,
+            (std::vector<std::string>{"waiting for the tasking configuration",
+                                      "reading the trace store", "summarising", "idle"}));
 }
 
 TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsBeforeTheSummary) {
@@ -105,7 +103,7 @@ TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsBeforeTheSummary) {
       sender.events[0].json,
       R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open","IntervalType":"Event",)"
       R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
-  EXPECT_EQ(observer.delivered, 3u);
+  EXPECT_GE(status.steps, 3u);
 }
 
 TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
@@ -115,7 +113,7 @@ TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
   EXPECT_TRUE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(extractor->calls.empty());
   EXPECT_TRUE(sender.events.empty());
-  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::notTasked);
+  EXPECT_EQ(reports.at(0).ending, RunEnding::notTasked);
 }
 
 TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
@@ -128,8 +126,8 @@ TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
   EXPECT_TRUE(sender.events.empty());
   perform();
   EXPECT_EQ(sender.names().back(), "com.vantor.performance.tessel_reporting_stats");
-  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::bailedOut);
-  EXPECT_EQ(observer.reports.at(1).outcome, RunOutcome::completed);
+  EXPECT_EQ(reports.at(0).ending, RunEnding::bailedOut);
+  EXPECT_EQ(reports.at(1).ending, RunEnding::completed);
 }
 
 TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
@@ -137,7 +135,7 @@ TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
   perform();
   EXPECT_EQ(log.lines().back(), "Could not create cookie file");
   EXPECT_TRUE(extractor->calls.empty());
-  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::noMarker);
+  EXPECT_EQ(reports.at(0).ending, RunEnding::noMarker);
 }
 
 TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
@@ -162,7 +160,8 @@ TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
   EXPECT_EQ(log.count("Failed to process tessel data due to error: /store: no such directory"), 1u);
   EXPECT_NE(sender.events.back().json.find("\"LogObjectsProcessed\":7"), std::string::npos);
   EXPECT_FALSE(files.items.contains(cookieFilePath));
-  EXPECT_EQ(observer.reports.at(0).outcome, RunOutcome::extractionFailed);
+  EXPECT_EQ(reports.at(0).ending, RunEnding::extractionFailed);
+  EXPECT_EQ(reports.at(0).failure, "/store: no such directory");
 }
 
 TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
@@ -197,10 +196,11 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
   perform();
   EXPECT_EQ(log.count("Trying to stop in-flight reporting work."), 1u);
   EXPECT_EQ(log.count("Concluding processing due to deferral request"), 1u);
-  EXPECT_EQ(observer.delivered, 0u);
+  EXPECT_EQ(sender.names(),
+            std::vector<std::string>{"com.vantor.performance.tessel_reporting_stats"});
   EXPECT_NE(sender.events.back().json.find("\"WasInterrupted\":true"), std::string::npos);
   EXPECT_TRUE(activity->statesSet.empty());
-  EXPECT_TRUE(observer.reports.at(0).interruptedByDeferral);
+  EXPECT_TRUE(reports.at(0).interruptedByDeferral);
   const auto timer = queues.timers.back();
   EXPECT_EQ(timer->interval, std::chrono::seconds{10});
   EXPECT_EQ(timer->leeway, std::chrono::seconds{10});
@@ -209,7 +209,7 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
 
 TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   perform();
-  observer.reports.clear();
+  reports.clear();
   const std::weak_ptr<testing::FakeExtractor> weak = extractor;
   extractor.reset();
   EXPECT_TRUE(weak.expired());
@@ -240,6 +240,7 @@ TEST_F(ReportingRunTest, FivePairsOfASectionAreSentAndTheRestOnlyCounted) {
     if (event.name == "com.vantor.performance.tessel_counts") counts.push_back(event.json);
   }
   ASSERT_EQ(counts.size(), 5u);
+  EXPECT_EQ(reports.at(0).countEvents, 5u);
   EXPECT_EQ(
       counts[0],
       R"({"Subsystem":"com.vantor.Calendar","Category":"C6","Count":7,"Classification":"AllInspected"})");
@@ -355,7 +356,7 @@ TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTrans
     EXPECT_EQ(log.lines(), std::vector<std::string>{c.line});
     EXPECT_EQ(runtime.calls, aroundEverything);
   }
-  EXPECT_TRUE(observer.reports.empty());
+  EXPECT_TRUE(reports.empty());
 }
 
 TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
@@ -371,7 +372,7 @@ TEST_F(ReporterActivityTest, ADeferralThatIsNotTakenRunsAllTheSame) {
   activity->deferWanted = true;
   activity->takesStates = false;
   handle();
-  EXPECT_EQ(observer.reports.size(), 1u);
+  EXPECT_EQ(reports.size(), 1u);
   EXPECT_EQ(log.count("Deferred tessel_reporter\n"), 0u);
   EXPECT_EQ(runtime.calls, aroundEverything);
 }

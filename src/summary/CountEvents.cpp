@@ -32,6 +32,7 @@ void CountReporter::reportCountForKey(const TesselReporterAggregationKey& key,
   } else {
     sender_.sendEvent("com.vantor.performance.tessel_counts",
                       countPayload(key, count, classification));
+    ++sentCount_;
     tesselReporterLog().debug("%@:\t%llu (Count reported to Statora)", key, count);
   }
   ++sectionKeyCount_;

@@ -22,10 +22,13 @@ class CountReporter {
   void reportCountForKey(const TesselReporterAggregationKey& key,
                          const TesselReporterAggregation& aggregation,
                          std::string_view classification);
+  // Events sent so far, over all sections.
+  uint64_t sentCount() const { return sentCount_; }
 
  private:
   EventSender& sender_;
   Throttle& throttle_;
+  uint64_t sentCount_ = 0;
   uint64_t sectionKeyCount_ = 0;
 };
 

@@ -50,11 +50,11 @@ Payload runSummaryPayload(const TesselReporterObjectFilter& filter,
 
 }  // namespace
 
-void RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
-                                  const TesselSupportObjectExtractor& extractor, Date startDate,
-                                  Date endDate, const std::atomic<bool>& interruptedByDeferral,
-                                  uint64_t processingStartTime) {
-  reportSections(filter);
+uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
+                                      const TesselSupportObjectExtractor& extractor, Date startDate,
+                                      Date endDate, const std::atomic<bool>& interruptedByDeferral,
+                                      uint64_t processingStartTime) {
+  const uint64_t countEvents = reportSections(filter);
   const float seconds = secondsSince(processingStartTime);
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
                     runSummaryPayload(filter, extractor, seconds, interruptedByDeferral));
@@ -80,18 +80,21 @@ void RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
     log.debug("Throttled %llu times for a total of %llu usec", throttle_.throttledCount(),
               throttle_.throttledMicroseconds());
   }
+  return countEvents;
 }
 
-void RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
+uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
   CountReporter counts(sender_, throttle_);
   for (const Section& section : kSections) {
     const TesselReporterAggregation& aggregation = (filter.*section.aggregation)();
     tesselReporterLog().debug(section.header, aggregation.totalCount());
     counts.beginSection();
     for (const TesselReporterAggregationKey* key : aggregation.keysInDescendingCountOrder()) {
+      status_.progress();
       counts.reportCountForKey(*key, aggregation, section.classification);
     }
   }
+  return counts.sentCount();
 }
 
 float RunSummary::secondsSince(uint64_t startTime) {

@@ -15,6 +15,7 @@
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Analytics.h"
 #include "platform/Clock.h"
+#include "platform/ServiceStatus.h"
 #include "platform/System.h"
 #include "platform/Throttle.h"
 
@@ -22,24 +23,27 @@ namespace tessel {
 
 class RunSummary {
  public:
-  RunSummary(EventSender& sender, Throttle& throttle, Clock& clock, DateFormatter& dates)
-      : sender_(sender), throttle_(throttle), clock_(clock), dates_(dates) {}
+  RunSummary(EventSender& sender, Throttle& throttle, Clock& clock, DateFormatter& dates,
+             ServiceStatus& status)
+      : sender_(sender), throttle_(throttle), clock_(clock), dates_(dates), status_(status) {}
 
   // `startDate` and `endDate` bound the period that was read; `processingStartTime` is in ticks of
   // the continuous clock. `interruptedByDeferral` may still change while the summary runs.
-  void reportRunSummary(const TesselReporterObjectFilter& filter,
-                        const TesselSupportObjectExtractor& extractor, Date startDate, Date endDate,
-                        const std::atomic<bool>& interruptedByDeferral,
-                        uint64_t processingStartTime);
+  // Answers how many count events it sent.
+  uint64_t reportRunSummary(const TesselReporterObjectFilter& filter,
+                            const TesselSupportObjectExtractor& extractor, Date startDate,
+                            Date endDate, const std::atomic<bool>& interruptedByDeferral,
+                            uint64_t processingStartTime);
 
  private:
-  void reportSections(const TesselReporterObjectFilter& filter);
+  uint64_t reportSections(const TesselReporterObjectFilter& filter);
   float secondsSince(uint64_t startTime);
 
   EventSender& sender_;
   Throttle& throttle_;
   Clock& clock_;
   DateFormatter& dates_;
+  ServiceStatus& status_;
   std::once_flag factorMade_;
   double secondsPerTick_ = 0;
 };
