@@ -1,0 +1,62 @@
+// EntryChain: the offsets of a journal file's entries as its chain of entry arrays lists them.
+//
+// The chain is read in small pieces. A piece whose offsets are not all possible and strictly
+// increasing is not used at all, and a broken link ends the chain: in both cases the caller is told
+// that entries may lie in between, to look for them in line.
+//
+// Threads: one at a time.
+
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <optional>
+
+#include "linux/trace/JournalFile.h"
+
+namespace tessel {
+
+class EntryChain {
+ public:
+  // What the chain knows of the next entry.
+  struct Step {
+    std::optional<uint64_t> offset;  // nothing: the chain ends here
+    bool gapBefore = false;          // entries that the chain does not list may come first
+  };
+
+  // `file` must outlive the chain.
+  explicit EntryChain(JournalFile& file);
+
+  // The next offset, greater than all before. `problemAt` of the last gap says where it was.
+  Step next();
+  uint64_t problemAt() const { return problemAt_; }
+
+ private:
+  static constexpr size_t kPieceBytes = 1024;
+
+  bool loadPiece();
+  bool enterArray(uint64_t offset);
+  void finishArray();
+  bool takePiece(size_t count);
+  void damagedAt(uint64_t offset) {
+    gap_ = true;
+    problemAt_ = offset;
+  }
+  uint64_t itemAt(size_t index) const;
+
+  JournalFile& file_;
+  const size_t itemSize_;
+  std::array<uint8_t, kPieceBytes> piece_;
+  size_t pieceSize_ = 0;  // in items
+  size_t pieceNext_ = 0;
+  uint64_t array_ = 0;       // offset of the array that is read; 0: none is left
+  uint64_t nextArray_ = 0;   // the one it links to
+  uint64_t arraySize_ = 0;   // items it holds
+  uint64_t arrayIndex_ = 0;  // items of it that were read
+  uint64_t listed_ = 0;      // items read in all arrays
+  uint64_t last_ = 0;        // greatest offset handed out
+  bool gap_ = false;
+  uint64_t problemAt_ = 0;
+};
+
+}  // namespace tessel

@@ -1,0 +1,80 @@
+#include "linux/trace/EntryMerger.h"
+
+#include <algorithm>
+#include <tuple>
+#include <utility>
+
+namespace tessel {
+
+namespace {
+constexpr Id128 kNoId{};
+}
+
+bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
+  if (a.sequenceId == b.sequenceId && a.sequenceId != kNoId && a.sequenceNumber != b.sequenceNumber)
+    return a.sequenceNumber < b.sequenceNumber;
+  if (a.bootId == b.bootId && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
+  return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
+         std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
+}
+
+bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
+  return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
+         a.realtime == b.realtime && a.monotonic == b.monotonic && a.bootId == b.bootId &&
+         a.sequenceId == b.sequenceId && a.sequenceId != kNoId && a.contentHash != 0;
+}
+
+void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
+  if (!stream->next()) return;
+  const EntryHeader* header = &stream->header();
+  heap_.push_back({std::move(stream), header, number, 0});
+}
+
+bool EntryMerger::next() {
+  if (started_ && !heap_.empty()) {
+    dropDuplicates();
+    advance(0);
+  } else if (!started_) {
+    started_ = true;
+    for (size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
+  }
+  ++current_;
+  return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+}
+
+// Moves the stream at `index` to its next entry, or closes it at its end.
+void EntryMerger::advance(size_t index) {
+  if (!heap_[index].stream->next()) {
+    std::swap(heap_[index], heap_.back());
+    heap_.pop_back();
+  }
+  siftDown(index);
+}
+
+void EntryMerger::siftDown(size_t index) {
+  for (;;) {
+    size_t first = index;
+    for (size_t child = 2 * index + 1; child <= 2 * index + 2 && child < heap_.size(); ++child)
+      if (comesBefore(*heap_[child].header, *heap_[first].header)) first = child;
+    if (first == index) return;
+    std::swap(heap_[index], heap_[first]);
+    index = first;
+  }
+}
+
+// Skips the current entry, once, in all streams but its own. What equals the first of the heap can
+// only be right below it, and what is below that comes up when it is skipped.
+void EntryMerger::dropDuplicates() {
+  for (size_t child = 1; child <= 2 && child < heap_.size();) {
+    if (heap_[child].droppedAt != current_ &&
+        sameEntry(*heap_[child].header, *heap_.front().header)) {
+      heap_[child].droppedAt = current_;
+      ++duplicates_;
+      advance(child);
+    } else {
+      ++child;
+    }
+  }
+}
+
+}  // namespace tessel

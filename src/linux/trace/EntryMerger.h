@@ -1,0 +1,64 @@
+// EntryMerger: many entry streams as one, in the journal's own order.
+//
+// Of two entries, the one with the lower number comes first where both count in the same sequence,
+// else the earlier by the monotonic clock where both are of one boot, else the earlier by the wall
+// clock. An entry that stands in several streams is delivered once; equal entries of one stream are
+// all delivered.
+//
+// Threads: one at a time, but for the stop flag.
+
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <unordered_map>
+#include <vector>
+
+#include "linux/trace/EntryStream.h"
+
+namespace tessel {
+
+// Whether `a` comes before `b`.
+bool comesBefore(const EntryHeader& a, const EntryHeader& b);
+// Whether both are the same entry, found in two places. An entry of no sequence, or without a hash,
+// is the same as none.
+bool sameEntry(const EntryHeader& a, const EntryHeader& b);
+
+class EntryMerger final : public EntryStream {
+ public:
+  // `stop` must outlive the merger.
+  explicit EntryMerger(const StopFlag& stop) : stop_(stop) {}
+
+  // Adds a stream; it is asked for its first entry at once, and closed after its last.
+  // REQUIRES: next() was not called.
+  void add(std::unique_ptr<EntryStream> stream, uint32_t number);
+
+  bool next() override;
+  const EntryHeader& header() const override { return *heap_.front().header; }
+  Entry entry() override { return heap_.front().stream->entry(); }
+  // Number of the stream that the current entry is from. REQUIRES: next() answered true.
+  uint32_t streamNumber() const { return heap_.front().number; }
+  // Entries left out as they stand in another stream as well.
+  uint64_t duplicates() const { return duplicates_; }
+
+ private:
+  struct Source {
+    std::unique_ptr<EntryStream> stream;
+    const EntryHeader* header;
+    uint32_t number;
+    uint64_t droppedAt = 0;  // of the current entries, by count, the last that it lost a twin of
+  };
+
+  void advance(size_t index);
+  void siftDown(size_t index);
+  void dropDuplicates();
+
+  const StopFlag& stop_;
+  std::vector<Source> heap_;
+  bool started_ = false;
+  uint64_t current_ = 0;  // entries delivered, the current one included
+  uint64_t duplicates_ = 0;
+};
+
+}  // namespace tessel

@@ -1,0 +1,163 @@
+#include "linux/trace/JournalFile.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <system_error>
+#include <utility>
+
+namespace tessel {
+
+using namespace journal_format;
+
+namespace {
+
+uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
+  switch (type) {
+    case kData:
+      return dataHeaderSize + 1;
+    case kField:
+      return kFieldHeaderSize + 1;
+    case kEntry:
+      return kEntryItemsAt + kCompactEntryItemSize;
+    case kEntryArray:
+      return kArrayItemsAt + kCompactEntryItemSize;
+    case kTag:
+      return kTagSize;
+    default:
+      return kObjectHeaderSize + 1;
+  }
+}
+
+Id128 loadId(const uint8_t* at) {
+  Id128 id;
+  std::copy_n(at, id.size(), id.begin());
+  return id;
+}
+
+// Where the objects end: with the arena, or with the file where the arena claims more or grows.
+uint64_t endOfObjects(const JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
+  if (header.beingWritten() || arenaSize > fileSize - header.headerSize) return fileSize;
+  return header.headerSize + arenaSize;
+}
+
+}  // namespace
+
+std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint8_t> bytes,
+                                                            uint64_t fileSize) {
+  if (bytes.empty()) return "it is empty";
+  if (bytes.size() < kMinHeaderSize) return "too short for a journal";
+  const uint8_t* at = bytes.data();
+  if (std::memcmp(at, kSignature, 8) != 0) return "not a journal file";
+  JournalHeader header;
+  header.incompatibleFlags = load<uint32_t>(at + kIncompatibleFlagsAt);
+  header.state = at[kStateAt];
+  header.sequenceId = loadId(at + kSequenceIdAt);
+  header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
+  // A header of a damaged size is followed by objects all the same.
+  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
+      header.headerSize > std::min<uint64_t>(fileSize, 4096))
+    header.headerSize = kMinHeaderSize;
+  header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
+  // While a file is written, what lies behind its last object is not yet an object.
+  const auto lastObject = load<uint64_t>(at + kTailObjectAt);
+  const bool growing = header.beingWritten() && aligned(lastObject) &&
+                       lastObject >= header.headerSize && lastObject < header.objectsEnd;
+  header.lastObject = growing ? lastObject : UINT64_MAX;
+  header.entryCount = load<uint64_t>(at + kEntryCountAt);
+  header.entryArray = load<uint64_t>(at + kEntryArrayAt);
+  header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
+  header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
+  return header;
+}
+
+// The size is asked for last, so that it covers all that the header counts.
+std::variant<JournalBeginning, std::string> readJournalHeader(int fd) {
+  std::array<uint8_t, kMinHeaderSize> bytes;
+  const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
+  struct stat status {};
+  if (got < 0 || ::fstat(fd, &status) != 0) return std::generic_category().message(errno);
+  const auto fileSize = static_cast<uint64_t>(status.st_size);
+  auto parsed = parseJournalHeader(std::span(bytes).first(static_cast<size_t>(got)), fileSize);
+  if (auto* reason = std::get_if<std::string>(&parsed)) return std::move(*reason);
+  return JournalBeginning{std::get<JournalHeader>(parsed), fileSize};
+}
+
+JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header,
+                         WindowBudget& budget)
+    : header_(header),
+      file_(std::move(fd), size, budget),
+      itemSize_(header.compact() ? kCompactEntryItemSize : kEntryItemSize),
+      dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
+
+std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> bytes,
+                                                      uint64_t room) const {
+  const uint64_t first = load<uint64_t>(bytes.data());
+  ObjectHeader object{static_cast<uint8_t>(first & 0xff), static_cast<uint8_t>(first >> 8 & 0xff),
+                      load<uint64_t>(bytes.data() + kObjectSizeAt)};
+  // Six reserved bytes follow type and flags; only data has flags.
+  if (first >> 16 != 0 || object.type == kUnused || object.type > kTag) return std::nullopt;
+  if (object.flags != 0 && (object.type != kData || (object.flags & ~kKnownDataFlags) != 0))
+    return std::nullopt;
+  if (object.size < leastSize(object.type, dataHeaderSize_) || object.size > room)
+    return std::nullopt;
+  return object;
+}
+
+std::optional<EntryHeader> JournalFile::entryAt(uint64_t offset, uint64_t from, uint64_t& size) {
+  if (!mayHoldObject(offset, kEntryItemsAt)) return std::nullopt;
+  const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
+  if (at == nullptr) return std::nullopt;
+  const auto object = objectHeader({at, kEntryItemsAt}, objectsEnd() - offset);
+  if (!object || object->type != kEntry || (object->size - kEntryItemsAt) % itemSize_ != 0 ||
+      object->size == kEntryItemsAt)
+    return std::nullopt;
+  EntryHeader entry;
+  entry.sequenceId = header_.sequenceId;
+  entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
+  entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
+  entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
+  entry.bootId = loadId(at + kEntryBootAt);
+  entry.contentHash = load<uint64_t>(at + kEntryHashAt);
+  if (entry.sequenceNumber == 0 || entry.realtime == 0 || entry.realtime >= kMaxTime ||
+      entry.monotonic >= kMaxTime)
+    return std::nullopt;
+  size = object->size;
+  return entry;
+}
+
+std::optional<DataObject> JournalFile::checkedData(std::span<const uint8_t> bytes,
+                                                   uint64_t offset) const {
+  const auto object = objectHeader(bytes, objectsEnd() - offset);
+  if (!object || object->type != kData || bytes.size() <= dataHeaderSize_) return std::nullopt;
+  return DataObject{object->flags,
+                    load<uint64_t>(bytes.data() + kDataEntryCountAt),
+                    offset + dataHeaderSize_,
+                    object->size - dataHeaderSize_,
+                    {}};
+}
+
+std::optional<DataObject> JournalFile::dataAt(uint64_t offset,
+                                              std::span<uint8_t, kMaxDataRead> scratch) {
+  if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return std::nullopt;
+  std::span<const uint8_t> bytes = file_.restOfWindow(offset);
+  const uint64_t size =
+      bytes.size() < kObjectHeaderSize ? UINT64_MAX : load<uint64_t>(bytes.data() + kObjectSizeAt);
+  const size_t wanted = dataHeaderSize_ + kMaxFieldHead;
+  if (bytes.size() < std::min<uint64_t>(size, wanted)) {
+    const uint64_t room = std::min<uint64_t>(wanted, objectsEnd() - offset);
+    bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(room)})};
+    if (bytes.size() <= dataHeaderSize_) return std::nullopt;
+  }
+  auto data = checkedData(bytes, offset);
+  if (!data) return std::nullopt;
+  data->head = bytes.subspan(
+      dataHeaderSize_, static_cast<size_t>(std::min<uint64_t>(
+                           {data->payloadSize, kMaxFieldHead, bytes.size() - dataHeaderSize_})));
+  return data;
+}
+
+}  // namespace tessel

@@ -1,0 +1,207 @@
+#include "linux/trace/TraceStore.h"
+
+#include <algorithm>
+#include <utility>
+#include <vector>
+
+#include "linux/trace/EntryMerger.h"
+#include "linux/trace/JournalEntryStream.h"
+#include "linux/trace/LossTokenizer.h"
+#include "linux/trace/StoreFiles.h"
+
+namespace tessel {
+
+namespace {
+
+// Follows the numbers of each sequence and counts those that do not appear.
+class SequenceWatch {
+ public:
+  void see(const EntryHeader& entry) {
+    if (last_ < seen_.size() && seen_[last_].id == entry.sequenceId) {
+      advance(seen_[last_], entry.sequenceNumber);
+    } else {
+      change(entry);
+    }
+  }
+  uint64_t gaps() const { return gaps_; }
+  uint64_t missing() const { return missing_; }
+
+ private:
+  // Sequences beyond this number are not followed.
+  static constexpr size_t kMaxSequences = 1024;
+
+  struct Sequence {
+    Id128 id;
+    uint64_t number;
+  };
+
+  void advance(Sequence& sequence, uint64_t number) {
+    if (number > sequence.number + 1) {
+      ++gaps_;
+      missing_ += number - sequence.number - 1;
+    }
+    sequence.number = std::max(sequence.number, number);
+  }
+  void change(const EntryHeader& entry);
+
+  std::vector<Sequence> seen_;
+  size_t last_ = 0;
+  uint64_t gaps_ = 0;
+  uint64_t missing_ = 0;
+};
+
+void SequenceWatch::change(const EntryHeader& entry) {
+  if (entry.sequenceId == Id128{}) return;
+  const auto known = std::find_if(seen_.begin(), seen_.end(), [&](const Sequence& sequence) {
+    return sequence.id == entry.sequenceId;
+  });
+  if (known == seen_.end() && seen_.size() >= kMaxSequences) return;
+  last_ = static_cast<size_t>(known - seen_.begin());
+  if (known == seen_.end()) {
+    seen_.push_back({entry.sequenceId, entry.sequenceNumber});
+  } else {
+    advance(*known, entry.sequenceNumber);
+  }
+}
+
+}  // namespace
+
+struct TraceStore::State final : EntryStream {
+  State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag)
+      : range(timeRange), stop(stopFlag), tokenizer(user), merger(stopFlag) {
+    facts.rangeStart = range.start;
+  }
+
+  bool next() override;
+  const EntryHeader& header() const override { return merger.header(); }
+  Entry entry() override;
+
+  void openFiles(StoreFiles found);
+  std::unique_ptr<EntryStream> openFile(StoreFile& file, uint32_t number);
+  std::unique_ptr<EntryStream> openJournal(StoreFile& file, uint32_t number);
+  bool outsideRange(const JournalHeader& header) const;
+  std::optional<PlatformError> failure(const std::string& place) const;
+  void seeTime(uint64_t realtime) {
+    if (!facts.oldestEntry || realtime < *facts.oldestEntry) facts.oldestEntry = realtime;
+  }
+
+  const TimeRange range;
+  const StopFlag& stop;
+  JournalReadResources resources;
+  LossTokenizer tokenizer;
+  StoreReport facts;  // its files are complete before the first stream is made
+  size_t usableFiles = 0;
+  SequenceWatch sequences;
+  EntryMerger merger;
+};
+
+bool TraceStore::State::next() {
+  while (merger.next()) {
+    const EntryHeader& entry = merger.header();
+    sequences.see(entry);
+    seeTime(entry.realtime);
+    if (entry.realtime < range.start || entry.realtime >= range.end) continue;
+    ++facts.entriesRead;
+    ++facts.files[merger.streamNumber()].entriesRead;
+    return true;
+  }
+  return false;
+}
+
+Entry TraceStore::State::entry() {
+  const Entry whole = merger.entry();
+  return {whole.header, tokenizer.takeOwn(whole.tokens)};
+}
+
+// All streams are made before the first is read, so that each knows its share of the memory.
+void TraceStore::State::openFiles(StoreFiles found) {
+  facts.filesNotLookedAt = found.leftOut;
+  facts.files.resize(found.files.size());
+  std::vector<std::pair<std::unique_ptr<EntryStream>, uint32_t>> streams;
+  for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
+    facts.files[i].path = found.files[i].path;
+    if (auto stream = openFile(found.files[i], i)) streams.emplace_back(std::move(stream), i);
+  }
+  for (auto& [stream, number] : streams) merger.add(std::move(stream), number);
+}
+
+std::unique_ptr<EntryStream> TraceStore::State::openFile(StoreFile& file, uint32_t number) {
+  FileReport& report = facts.files[number];
+  if (!file.fd.valid()) {
+    report.skipped = whyNotOpened(file.error);
+    return nullptr;
+  }
+  if (file.kind == StoreFileKind::exportStream) {
+    report.skipped = "export files are not read";
+    return nullptr;
+  }
+  return openJournal(file, number);
+}
+
+std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
+  FileReport& report = facts.files[number];
+  auto opened = readJournalHeader(file.fd.get());
+  if (auto* reason = std::get_if<std::string>(&opened)) {
+    report.skipped = std::move(*reason);
+    return nullptr;
+  }
+  const auto& [header, size] = std::get<JournalBeginning>(opened);
+  if (header.unknownFlags() != 0) {
+    report.skipped = "written with features that are not known";
+    return nullptr;
+  }
+  ++usableFiles;
+  if (header.headRealtime != 0) seeTime(header.headRealtime);
+  if (outsideRange(header)) {
+    report.skipped = "outside the range";
+    return nullptr;
+  }
+  return std::make_unique<JournalEntryStream>(
+      std::move(file.fd), size, header, number,
+      JournalEntryStream::Context{resources, tokenizer, stop, report});
+}
+
+// A clock that was set back within the file shows where its ends stand the wrong way round.
+bool TraceStore::State::outsideRange(const JournalHeader& header) const {
+  if (header.beingWritten() || header.headRealtime == 0 ||
+      header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
+    return false;
+  return header.tailRealtime < range.start || header.headRealtime >= range.end;
+}
+
+// Why the store as a whole cannot be used, where that is so.
+std::optional<PlatformError> TraceStore::State::failure(const std::string& place) const {
+  if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
+  if (facts.files.empty())
+    return PlatformError{place + ": holds no *.journal, *.journal~ or *.export file"};
+  const FileReport& first = facts.files.front();
+  return PlatformError{first.path + ": " + first.skipped.value_or("not readable")};
+}
+
+TraceStore::TraceStore(std::unique_ptr<State> state) : state_(std::move(state)) {}
+TraceStore::~TraceStore() = default;
+
+std::variant<std::unique_ptr<TraceStore>, PlatformError> TraceStore::open(
+    const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
+    const StopFlag& stop) {
+  auto found = openStoreFiles(path, kMaxFiles, stop);
+  if (auto* error = std::get_if<PlatformError>(&found)) return std::move(*error);
+  const std::string place = path.value_or("the machine's journal");
+  auto state = std::make_unique<State>(range, tokenizer, stop);
+  state->openFiles(std::get<StoreFiles>(std::move(found)));
+  if (auto error = state->failure(place)) return std::move(*error);
+  return std::unique_ptr<TraceStore>(new TraceStore(std::move(state)));
+}
+
+EntryStream& TraceStore::entries() { return *state_; }
+
+StoreReport TraceStore::report() const {
+  StoreReport report = state_->facts;
+  report.duplicateEntries = state_->merger.duplicates();
+  report.sequenceGaps = state_->sequences.gaps();
+  report.missingEntries = state_->sequences.missing();
+  report.dropped = state_->tokenizer.dropped();
+  return report;
+}
+
+}  // namespace tessel
