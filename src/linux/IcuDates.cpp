@@ -29,6 +29,12 @@ std::unique_ptr<icu::TimeZone> makeTimeZone(const std::optional<std::string>& na
       icu::TimeZone::createTimeZone(icu::UnicodeString::fromUTF8(*name)));
 }
 
+// ICU must not be given a locale whose name it cannot read; that one counts as none.
+icu::Locale makeLocale(const std::string& name) {
+  const icu::Locale locale = icu::Locale::createCanonical(name.c_str());
+  return locale.isBogus() ? icu::Locale::createCanonical("C") : locale;
+}
+
 }  // namespace
 
 IcuDates::IcuDates() : IcuDates(localeForDates(), {}) {}
@@ -39,9 +45,8 @@ IcuDates::IcuDates(std::string locale, std::optional<std::string> timeZone)
 std::string IcuDates::format(Date date) {
   const auto milliseconds =
       std::chrono::floor<std::chrono::milliseconds>(date).time_since_epoch().count();
-  const std::unique_ptr<icu::DateFormat> formatter(
-      icu::DateFormat::createDateTimeInstance(icu::DateFormat::kShort, icu::DateFormat::kMedium,
-                                              icu::Locale::createCanonical(locale_.c_str())));
+  const std::unique_ptr<icu::DateFormat> formatter(icu::DateFormat::createDateTimeInstance(
+      icu::DateFormat::kShort, icu::DateFormat::kMedium, makeLocale(locale_)));
   // ICU without its data can make no format; the log then shows the plain number.
   if (!formatter) return std::to_string(milliseconds / 1000);
   if (auto zone = makeTimeZone(timeZone_)) formatter->adoptTimeZone(zone.release());

@@ -103,8 +103,7 @@ std::optional<LogLevel> logLevel(std::string_view text) {
 std::string LaunchError::line() const {
   std::string shown = value.substr(0, kMaxQuotedValue);
   if (shown.size() < value.size()) shown += "...";
-  return "tessel_reporter: " + variable + "=\"" + plainText(shown, "\\x0a") +
-         "\" makes no sense: expected " + expected;
+  return variable + "=\"" + plainText(shown, "\\x0a") + "\" makes no sense: expected " + expected;
 }
 
 std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(

@@ -9,10 +9,10 @@
 
 #include <cerrno>
 #include <charconv>
-#include <cstdio>
 #include <filesystem>
 #include <system_error>
 
+#include "linux/DurableFile.h"
 #include "linux/Files.h"
 #include "linux/PlainText.h"
 
@@ -23,6 +23,12 @@ namespace {
 constexpr mode_t kDirectoryMode = 0750;
 constexpr mode_t kFileMode = 0640;
 constexpr size_t kMaxRecordSize = 64;
+
+// A slash at the end would pass for a name of its own when the directory above is looked for.
+std::string withoutTrailingSlashes(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  return path;
+}
 
 // Makes the directory and what is missing above it; the errno of what went wrong, or 0.
 int makeDirectory(const std::string& path) {
@@ -42,25 +48,17 @@ UniqueFd openLockFile(const std::string& directory) {
       ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, kFileMode));
 }
 
-// An error of the last system call on `path`, in words.
-std::string lastError(const std::string& path) { return path + ": " + errorWords(errno); }
-
-std::optional<std::string> writeDurably(const std::string& path, const std::string& text) {
-  const UniqueFd file(
-      ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, kFileMode));
-  if (!file.valid() || !writeAll(file.get(), text) || ::fsync(file.get()) != 0)
-    return lastError(path);
-  return {};
-}
-
 }  // namespace
 
 std::variant<StateDirectory, std::string> StateDirectory::open(const std::string& path) {
-  const std::string shown = "state directory " + plainText(path, "\\x0a") + ": ";
-  if (const int error = makeDirectory(path)) return shown + errorWords(error);
-  if (!openLockFile(path).valid())
-    return shown + "cannot open its file \"lock\": " + errorWords(errno);
-  return StateDirectory(path);
+  const std::string plain = withoutTrailingSlashes(path);
+  const std::string shown = "state directory " + plainText(plain, "\\x0a") + ": ";
+  if (const int error = makeDirectory(plain)) return shown + errorWords(error);
+  if (!openLockFile(plain).valid()) {
+    const int error = errno;
+    return shown + "cannot open its file \"lock\": " + errorWords(error);
+  }
+  return StateDirectory(plain);
 }
 
 std::optional<RunLock> StateDirectory::lock(int operation) const {
@@ -87,13 +85,7 @@ std::optional<Date> StateDirectory::lastRun() const {
 }
 
 std::optional<std::string> StateDirectory::recordRun(Date begin) const {
-  const std::string fresh = recordFile() + ".new";
-  if (auto error = writeDurably(fresh, std::to_string(begin.time_since_epoch().count()) + '\n'))
-    return error;
-  if (std::rename(fresh.c_str(), recordFile().c_str()) != 0) return lastError(recordFile());
-  const UniqueFd directory(::open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!directory.valid() || ::fsync(directory.get()) != 0) return lastError(path_);
-  return {};
+  return replaceFileDurably(recordFile(), std::to_string(begin.time_since_epoch().count()) + '\n');
 }
 
 }  // namespace tessel

@@ -68,6 +68,8 @@ TEST_F(StateDirectoryTest, IsMadeForItsOwnerAndGroupAndKeptWhenItIsThere) {
   struct stat facts {};
   ASSERT_EQ(::stat(state_.path().c_str(), &facts), 0);
   EXPECT_EQ(facts.st_mode & 07777 & ~0750u, 0u);
+  ASSERT_EQ(::stat(opened(temporary_.path("slashed//")).path().c_str(), &facts), 0);
+  EXPECT_EQ(facts.st_mode & 07777 & ~0750u, 0u);
   state_.recordRun(kNoon);
   EXPECT_EQ(opened(state_.path() + "/").lastRun(), kNoon);
 }
