@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "linux/trace/EntryMerger.h"
+#include "linux/trace/ExportEntryStream.h"
 #include "linux/trace/JournalEntryStream.h"
 #include "linux/trace/LossTokenizer.h"
 #include "linux/trace/StoreFiles.h"
@@ -132,8 +133,8 @@ std::unique_ptr<EntryStream> TraceStore::State::openFile(StoreFile& file, uint32
     return nullptr;
   }
   if (file.kind == StoreFileKind::exportStream) {
-    report.skipped = "export files are not read";
-    return nullptr;
+    ++usableFiles;
+    return std::make_unique<ExportEntryStream>(file.fd.release(), tokenizer, stop, report);
   }
   return openJournal(file, number);
 }
