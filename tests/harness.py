@@ -154,7 +154,13 @@ class Machine:
         return process
 
     def result(self, process, timeout=120):
-        process.wait(timeout)
+        """Waits for the program to end by itself; one that does not is killed and fails the test."""
+        try:
+            process.wait(timeout)
+        except subprocess.TimeoutExpired:
+            process.kill()
+            process.wait()
+            raise
         return Result(process)
 
     def run(self, **extra):
@@ -173,6 +179,8 @@ class Machine:
         if not os.path.exists(path):
             return []
         with contextlib.closing(sqlite3.connect(path)) as database:
+            if not database.execute("SELECT 1 FROM sqlite_master WHERE name = 'events'").fetchall():
+                return []  # looked at in the moment between making the file and making the table
             rows = database.execute("SELECT name, payload FROM events ORDER BY id").fetchall()
         return [(name, json.loads(payload, object_pairs_hook=list)) for name, payload in rows]
 
@@ -185,8 +193,9 @@ class Result:
 
     @staticmethod
     def _read(file):
-        file.seek(0)
-        return file.read().decode("utf-8", "surrogateescape")
+        with file:
+            file.seek(0)
+            return file.read().decode("utf-8", "surrogateescape")
 
     @property
     def log(self):

@@ -97,7 +97,7 @@ class Malformed(MachineTest):
 
 class Deferral(MachineTest):
     def test_a_run_that_should_defer_is_offered_again(self):
-        self.machine.write_export(some_points(1))
+        self.machine.write_journal(some_points(1))
         wish = os.path.join(self.machine.state, "defer")
         open(wish, "w", encoding="utf-8").close()
         process = self.machine.start(TESSEL_DEFER_RETRY="1")
@@ -110,7 +110,7 @@ class Deferral(MachineTest):
         self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
 
     def test_a_deferral_in_the_middle_stops_the_run_and_is_said(self):
-        self.machine.write_export(some_points(3000))
+        self.machine.write_journal(some_points(3000))
         process = self.machine.start()
         wait_for(lambda: self.machine.rows())
         open(os.path.join(self.machine.state, "defer"), "w", encoding="utf-8").close()
@@ -125,7 +125,7 @@ class Deferral(MachineTest):
 
 class TwoProcesses(MachineTest):
     def test_the_second_is_given_the_run_when_the_first_is_done(self):
-        self.machine.write_export(some_points(60))
+        self.machine.write_journal(some_points(60))
         first = self.machine.start()
         wait_for(self.machine.marker_exists)
         second = self.machine.start()
@@ -147,7 +147,7 @@ class TwoProcesses(MachineTest):
 
 class Interrupt(MachineTest):
     def test_it_ends_with_0_at_once_whatever_is_going_on(self):
-        self.machine.write_export(some_points(400))
+        self.machine.write_journal(some_points(400))
         slack = 2.0 if harness.SANITIZED else 1.0
         for attempt in range(10):
             process = self.machine.start()
@@ -162,13 +162,13 @@ class Interrupt(MachineTest):
 
 class Crash(MachineTest):
     def test_the_run_after_a_crash_bails_out_and_the_one_after_reports(self):
-        self.machine.write_export(some_points(400))
+        self.machine.write_journal(some_points(400))
         for attempt in range(3):
             already = len(self.machine.rows())
             process = self.machine.start()
             wait_for(lambda: len(self.machine.rows()) > already + 3)
             process.kill()
-            process.wait()
+            self.machine.result(process)
             kept = self.machine.rows()
             self.assertTrue(self.machine.marker_exists())
             bailing = self.machine.run()
@@ -179,14 +179,14 @@ class Crash(MachineTest):
         check = subprocess.run(["sqlite3", os.path.join(self.machine.state, "statora.db"), "PRAGMA integrity_check"],
                                check=True, capture_output=True, text=True)
         self.assertEqual(check.stdout.strip(), "ok")
-        self.machine.write_export(some_points(1))
+        self.machine.write_journal(some_points(1))
         self.assert_clean(self.machine.run())
         self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
 
 
 class Pacing(MachineTest):
     def test_no_ten_sends_are_closer_than_a_quantum(self):
-        self.machine.write_export(some_points(100))
+        self.machine.write_journal(some_points(100))
         process = self.machine.start()
         self.assert_clean(self.machine.result(process))
         with sqlite3.connect(os.path.join(self.machine.state, "statora.db")) as database:
