@@ -14,7 +14,7 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxMetadataSize = 1024 * 1024;
+constexpr size_t kMaxMetadataSize = size_t{1} << 20;
 constexpr size_t kMaxIdentifierLength = 255;
 constexpr size_t kMaxDirectoryEntries = 10'000;
 

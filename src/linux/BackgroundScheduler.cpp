@@ -99,7 +99,6 @@ bool ActivityDeliveries::deliverRun() {
     return true;
   }
   record(begin);
-  status_.say("idle");
   return criteria_.interval.has_value();
 }
 

@@ -16,8 +16,7 @@ namespace {
 
 std::string localeForDates() {
   for (const char* variable : {"LC_ALL", "LC_TIME", "LANG"}) {
-    const char* value =
-        std::getenv(variable);  // NOLINT(concurrency-mt-unsafe): nobody sets variables
+    const char* value = std::getenv(variable);
     if (value && *value) return value;
   }
   return "C";

@@ -13,7 +13,7 @@ namespace tessel {
 namespace {
 
 // A year: longer waits are typing mistakes, and every sum of times stays far from overflow.
-constexpr int64_t kMaxSeconds = 365 * 86'400;
+constexpr int64_t kMaxSeconds = 31'536'000;
 constexpr size_t kMaxQuotedValue = 256;
 
 std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
@@ -134,8 +134,7 @@ std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
 
 EnvironmentReader processEnvironment() {
   return [](const std::string& name) -> std::optional<std::string> {
-    const char* value =
-        std::getenv(name.c_str());  // NOLINT(concurrency-mt-unsafe): nobody sets variables
+    const char* value = std::getenv(name.c_str());
     if (!value) return {};
     return value;
   };

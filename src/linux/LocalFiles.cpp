@@ -66,8 +66,7 @@ class Remover {
     if (!directory) return failed(path, errorWords(errno));
     const int inside = fd.release();
     bool removedAll = true;
-    while (const dirent* entry =
-               ::readdir(directory.get())) {  // NOLINT(concurrency-mt-unsafe): own stream
+    while (const dirent* entry = ::readdir(directory.get())) {
       const std::string_view item = entry->d_name;
       if (item == "." || item == "..") continue;
       removedAll =

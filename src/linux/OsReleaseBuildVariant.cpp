@@ -10,7 +10,7 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxOsReleaseSize = 64 * 1024;
+constexpr size_t kMaxOsReleaseSize = size_t{64} << 10;
 
 std::string_view withoutQuotes(std::string_view value) {
   const bool quoted =

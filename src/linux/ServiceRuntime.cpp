@@ -80,7 +80,6 @@ void ServiceRuntime::runMainLoop() {
   manager_.ready();
   waitUntilExitAllowed();
   manager_.stopping();
-  // NOLINTNEXTLINE(concurrency-mt-unsafe): what other threads still use is never destroyed
   std::exit(0);
 }
 

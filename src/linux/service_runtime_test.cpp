@@ -118,7 +118,7 @@ TEST_F(ProcessEndTest, AnInterruptBeforeTheSourceIsResumedIsDeliveredOnceItIs) {
         });
         const auto queue = std::make_shared<WorkerQueue>("interrupts");
         const auto source = runtime_.makeSignalSource(SIGINT, queue);
-        source->setHandler([] { std::exit(0); });  // NOLINT(concurrency-mt-unsafe)
+        source->setHandler([] { std::exit(0); });
         source->resume();
         runtime_.runMainLoop();
       },
@@ -132,7 +132,7 @@ TEST_F(ProcessEndTest, AnInterruptThatIsIgnoredByInheritanceStillEndsTheProcess)
         prepareProcess();
         const auto source =
             runtime_.makeSignalSource(SIGINT, std::make_shared<WorkerQueue>("interrupts"));
-        source->setHandler([] { std::exit(0); });  // NOLINT(concurrency-mt-unsafe)
+        source->setHandler([] { std::exit(0); });
         source->resume();
         ::kill(::getpid(), SIGINT);
         runtime_.runMainLoop();
