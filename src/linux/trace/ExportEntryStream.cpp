@@ -125,18 +125,18 @@ ExportEntryStream::Outcome ExportEntryStream::readField(const Line& line) {
 ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view name) {
   std::string head(name);
   head += '=';
+  const uint64_t lengthPlace = window_.place();
   if (!window_.fill(8)) return Outcome::ended;
   const uint64_t length = littleEndian(window_.bytes());
-  window_.consume(8);
-  const uint64_t valuePlace = window_.place();
   if (length > kMaxValueLength) return bad("value longer than any");
+  window_.consume(8);
   const auto shown = static_cast<size_t>(std::min<uint64_t>(length, kMaxFieldValueLength + 1));
   if (!window_.fill(shown)) return Outcome::ended;
   head.append(window_.bytes().substr(0, shown));
   if (!window_.skip(length) || !window_.fill(1)) return Outcome::ended;
   if (window_.bytes().front() != '\n') {
     // The length is wrong, so the empty line to go on after may lie within it.
-    window_.rewind(valuePlace);
+    window_.rewind(lengthPlace);
     return bad("value of another length than stated");
   }
   window_.consume(1);

@@ -8,8 +8,6 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxAttributes = 32;
-
 FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }

@@ -21,6 +21,9 @@
 
 namespace tessel {
 
+// Attributes that one entry may carry.
+inline constexpr size_t kMaxAttributes = 32;
+
 // Where assembled objects go.
 class TraceObjectSink {
  public:
