@@ -14,7 +14,7 @@ namespace tessel {
 
 namespace {
 
-// Longest single wait: the record, the wall clock and time asleep are looked at this often.
+// Longest single wait: the wall clock and the time spent asleep are looked at this often.
 constexpr std::chrono::nanoseconds kLongestWait = std::chrono::minutes{1};
 
 // One delivery to the activity. The state may change to "defer" while a run is being delivered.
@@ -122,21 +122,17 @@ std::optional<RunLock> ActivityDeliveries::waitForLock() {
   return state_.waitForLock();
 }
 
-// Answers the last run that the decision rests on.
+// Answers the last run that the decision rests on; the holder of the lock sees whether it still is.
 std::optional<Date> ActivityDeliveries::waitUntilDue() {
-  std::optional<Date> seen = lastRun();
+  const std::optional<Date> seen = lastRun();
   if (!criteria_.interval) return seen;
-  uint64_t begin = clock_.continuousTicks();
+  const uint64_t begin = clock_.continuousTicks();
   for (;;) {
     const std::chrono::nanoseconds remaining =
         waitForRun(seen, clock_.now(), *criteria_.interval, since(begin));
     if (remaining.count() == 0) return seen;
     status_.say("waiting until the next run is due");
     wait(std::min(remaining, kLongestWait));
-    if (lastRun() != seen) {
-      seen = lastRun();
-      begin = clock_.continuousTicks();
-    }
   }
 }
 

@@ -17,12 +17,11 @@ inline std::chrono::nanoseconds waitForRun(std::optional<Date> lastRun, Date now
                                            std::chrono::seconds interval,
                                            std::chrono::nanoseconds waited) {
   using std::chrono::nanoseconds;
-  if (!lastRun) return nanoseconds{0};
-  const nanoseconds longest = nanoseconds{interval} - waited;
-  if (*lastRun > now) return std::max(longest, nanoseconds{0});
-  if (now - *lastRun >= interval) return nanoseconds{0};
-  return std::clamp(nanoseconds{interval} - nanoseconds{now - *lastRun}, nanoseconds{0},
-                    std::max(longest, nanoseconds{0}));
+  const auto sinceLastRun = lastRun ? now - *lastRun : Date::duration::max();
+  if (sinceLastRun >= interval) return nanoseconds{0};
+  // A run in the future tells nothing: the whole interval is waited for.
+  const nanoseconds byWallClock = interval - std::max(sinceLastRun, Date::duration::zero());
+  return std::clamp(interval - waited, nanoseconds{0}, byWallClock);
 }
 
 }  // namespace tessel
