@@ -2,9 +2,12 @@
 
 #include "linux/statora/SpoolDatabase.h"
 
+#include <fcntl.h>
 #include <sqlite3.h>
 
 #include <iterator>
+
+#include "linux/UniqueFd.h"
 
 namespace tessel {
 
@@ -18,6 +21,12 @@ constexpr const char* kUpgrades[] = {
     "INSERT INTO meta VALUES('spool_id', lower(hex(randomblob(16))));",
 };
 static_assert(std::size(kUpgrades) == kSpoolSchemaVersion);
+
+// SQLite would give the group no leave to write, and the forwarder works as a member of it. Only a
+// file that is new is opened: closing another descriptor of a database drops this process's locks.
+void makeFileForGroup(const std::string& path) {
+  const UniqueFd made(::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0660));
+}
 
 SqliteStatus upgrade(SqliteDatabase& database) {
   if (SqliteStatus begun = database.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
@@ -51,6 +60,7 @@ SqliteStatus prepareSchema(SqliteDatabase& database) {
 
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds) {
+  makeFileForGroup(path);
   SqliteStatus status = database.open(path, SqliteDatabase::Mode::create);
   if (!status.ok()) return status;
   database.setBusyTimeout(busyTimeoutMilliseconds);

@@ -7,6 +7,7 @@
 #include <sqlite3.h>
 #include <sys/mount.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -119,6 +120,19 @@ TEST_F(SpoolTest, RowsStandInSendOrderWithTimeNameAndPayloadAsJson) {
   EXPECT_EQ(reader.database().integer("SELECT length(value) FROM meta WHERE key='spool_id'"), 32);
   EXPECT_EQ(spool.figures().stored, 2u);
   EXPECT_TRUE(log_.lines().empty());
+}
+
+TEST_F(SpoolTest, ItsGroupMayWriteItWhereTheProcessAllowsThat) {
+  const mode_t before = ::umask(0007);
+  Spool spool(directory_.path(), clock_);
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  ::umask(before);
+  using std::filesystem::perms;
+  const perms shared =
+      perms::owner_read | perms::owner_write | perms::group_read | perms::group_write;
+  for (const char* name : {"statora.db", "statora.db-wal", "statora.db-shm"}) {
+    EXPECT_EQ(std::filesystem::status(directory_.path(name)).permissions(), shared) << name;
+  }
 }
 
 TEST_F(SpoolTest, GoesOnWhereAnEarlierProcessEndedAndKeepsItsIdentifier) {
