@@ -1,0 +1,47 @@
+// ForwarderSettings: what the environment says about the forwarder, read once at its start.
+//
+// Where to and how follows OpenTelemetry's variables, OTEL_EXPORTER_OTLP_<NAME>, of which
+// OTEL_EXPORTER_OTLP_LOGS_<NAME> comes first: ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE,
+// CLIENT_CERTIFICATE, CLIENT_KEY, PROTOCOL (http/json alone). Secrets are files in
+// $CREDENTIALS_DIRECTORY: otlp-headers, otlp-certificate, otlp-client-certificate, otlp-client-key.
+//
+//   TESSEL_FORWARD_RATE        records a second; 0: no limit                        100
+//   TESSEL_FORWARD_SPREAD      seconds over which a start is spread                 300
+//   TESSEL_FORWARD_INTERVAL    seconds between looks for new events                 30
+//   TESSEL_FORWARD_RETRY       seconds until the first new attempt, at most         5
+//   TESSEL_FORWARD_ALLOW_HTTP  1: plain http to any host, not to loopback alone     unset
+//   TESSEL_FORWARD_INSTANCE_ID 1: say which machine, by an id made for this program unset
+
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "linux/LaunchConfiguration.h"
+
+namespace tessel {
+
+struct ForwarderSettings {
+  std::string url;
+  std::vector<std::string> headers;  // each "name: value"
+  std::chrono::milliseconds timeout{10'000};
+  bool compress = false;
+  // Paths; empty: the system's authorities, no client certificate.
+  std::string authorities, clientCertificate, clientKey;
+  uint64_t recordsPerSecond = 100;
+  std::chrono::seconds spread{300};
+  std::chrono::seconds interval{30};
+  std::chrono::milliseconds retry{5000};
+  bool sendInstanceId = false;
+};
+
+// The first variable that makes no sense is the error; that there is no endpoint is one. Headers
+// are never quoted in it.
+std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
+    const EnvironmentReader& environment);
+
+}  // namespace tessel

@@ -1,0 +1,364 @@
+#!/usr/bin/env python3
+"""The forwarder against a collector that behaves in every way that collectors do."""
+import email.utils
+import json
+import os
+import random
+import shutil
+import signal
+import socket
+import sqlite3
+import subprocess
+import tempfile
+import time
+import unittest
+
+import harness
+from otlp_receiver import Answer, Receiver, make_certificate, uid_of
+
+FORWARDER = os.path.join(harness.BIN, "statora_forwarder")
+SPOOL_ID = "0123456789abcdef0123456789abcdef"
+SCHEMA = """
+PRAGMA auto_vacuum=INCREMENTAL;
+PRAGMA journal_mode=WAL;
+CREATE TABLE events(id INTEGER PRIMARY KEY AUTOINCREMENT, time INTEGER NOT NULL, name TEXT NOT NULL,
+  payload TEXT NOT NULL);
+CREATE TABLE meta(key TEXT PRIMARY KEY, value TEXT NOT NULL) WITHOUT ROWID;
+PRAGMA user_version=1;
+"""
+
+
+def make_spool(state):
+    path = os.path.join(state, "statora.db")
+    with sqlite3.connect(path) as database:
+        database.executescript(SCHEMA)
+        database.execute("INSERT INTO meta VALUES('spool_id', ?)", (SPOOL_ID,))
+    return path
+
+
+class ForwarderTest(unittest.TestCase):
+    def setUp(self):
+        self.state = tempfile.mkdtemp(prefix="tessel-forwarder-")
+        self.addCleanup(shutil.rmtree, self.state, ignore_errors=True)
+        self.path = make_spool(self.state)
+        self.errors = ""
+
+    def add(self, count=1, payload='{"Name":"Open","Number1Value":%d}', name="com.vantor.performance.tessel"):
+        """Adds rows; %d in the payload counts them."""
+        with sqlite3.connect(self.path) as database:
+            for number in range(count):
+                text = payload % number if "%d" in payload else payload
+                database.execute("INSERT INTO events(time, name, payload) VALUES(?, ?, ?)",
+                                 (1_795_000_000_000_000 + number, name, text))
+
+    def query(self, sql):
+        with sqlite3.connect(self.path) as database:
+            return database.execute(sql).fetchall()
+
+    def counters(self):
+        return dict(self.query("SELECT name, value FROM forwarder"))
+
+    def waiting(self):
+        return self.query("SELECT count(*) FROM events")[0][0]
+
+    def environment(self, receiver, **more):
+        environment = {"PATH": os.environ["PATH"], "TESSEL_STATE_DIR": self.state, "TESSEL_LOG": "stderr",
+                       "TESSEL_FORWARD_RATE": "0", "TESSEL_FORWARD_RETRY": "1", "TESSEL_FORWARD_SPREAD": "0",
+                       "TESSEL_FORWARD_INTERVAL": "1"}
+        environment.update({name: os.environ[name] for name in os.environ if name.endswith("SAN_OPTIONS")})
+        if receiver:
+            environment["OTEL_EXPORTER_OTLP_ENDPOINT"] = receiver if isinstance(receiver, str) else receiver.url
+        environment.update(more)
+        return environment
+
+    def run_forwarder(self, receiver, *arguments, **more):
+        result = subprocess.run([FORWARDER, *(arguments or ["--once"])], env=self.environment(receiver, **more),
+                                capture_output=True, text=True, timeout=120)
+        self.errors = result.stderr
+        return result
+
+    def assert_all_arrived_once(self, receiver, count):
+        uids = receiver.accepted_uids()
+        self.assertEqual(uids, [f"{SPOOL_ID}-{number}" for number in range(1, count + 1)])
+        self.assertEqual(self.waiting(), 0)
+        self.assertEqual(self.counters()["delivered"], count)
+
+
+class Delivery(ForwarderTest):
+    def test_a_record_carries_the_event_with_its_kinds_and_order(self):
+        self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,'
+                         '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open")
+        with Receiver() as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        request = receiver.requests[0]
+        self.assertEqual(request.path, "/v1/logs")
+        self.assertEqual(request.headers["Content-Type"], "application/json")
+        self.assertIn('{"key":"F","value":{"doubleValue":0.1}}', request.text)
+        self.assertEqual(request.records, [{
+            "timeUnixNano": "1795000000000000000", "observedTimeUnixNano": "1795000000000000000",
+            "eventName": "ts__com.vantor.Calendar__View__Open",
+            "attributes": [{"key": "log.record.uid", "value": {"stringValue": SPOOL_ID + "-1"}},
+                           {"key": "Name", "value": {"stringValue": 'a"ü'}},
+                           {"key": "Z", "value": {"boolValue": True}},
+                           {"key": "A", "value": {"intValue": "-9223372036854775808"}},
+                           {"key": "B", "value": {"stringValue": "18446744073709551615"}},
+                           {"key": "F", "value": {"doubleValue": 0.1}},
+                           {"key": "DurationInSeconds", "value": {"doubleValue": 2}},
+                           {"key": "N", "value": {}}]}])
+        resource = json.loads(request.text)["resourceLogs"][0]["resource"]["attributes"]
+        self.assertEqual([attribute["key"] for attribute in resource],
+                         ["service.name", "service.version", "os.type", "os.name", "os.version", "host.arch"])
+        self.assertNotIn(socket.gethostname(), request.text)
+        self.assert_all_arrived_once(receiver, 1)
+
+    def test_batches_hold_512_records_or_one_mebibyte(self):
+        self.add(1100)
+        with Receiver() as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        self.assertEqual([len(request.records) for request in receiver.requests], [512, 512, 76])
+        self.assert_all_arrived_once(receiver, 1100)
+        self.add(5, payload=json.dumps({"Text": "x" * 400_000}))
+        self.add(1, payload=json.dumps({"Text": "x" * 2_000_000}))
+        with Receiver() as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        self.assertEqual([len(request.records) for request in receiver.requests], [2, 2, 1, 1])
+
+    def test_headers_secrets_and_compression(self):
+        self.add(100)
+        secrets = os.path.join(self.state, "credentials")
+        os.mkdir(secrets)
+        with open(os.path.join(secrets, "otlp-headers"), "w") as file:
+            file.write("authorization=Bearer%20secret\n")
+        with Receiver() as receiver:
+            result = self.run_forwarder(None, OTEL_EXPORTER_OTLP_LOGS_ENDPOINT=receiver.url + "/own/path",
+                                        OTEL_EXPORTER_OTLP_HEADERS="x-site=north,x-both=a%2Cb",
+                                        OTEL_EXPORTER_OTLP_COMPRESSION="gzip", CREDENTIALS_DIRECTORY=secrets)
+        self.assertEqual(result.returncode, 0, self.errors)
+        request = receiver.requests[0]
+        self.assertEqual(request.path, "/own/path")
+        self.assertEqual([request.headers[name] for name in ("authorization", "x-site", "x-both")],
+                         ["Bearer secret", "north", "a,b"])
+        self.assertTrue(request.gzipped)
+        self.assertLess(len(request.raw) * 5, len(request.text))
+        self.assert_all_arrived_once(receiver, 100)
+
+    def test_a_dry_run_prints_the_very_bodies_and_changes_nothing(self):
+        self.add(700)
+        printed = self.run_forwarder(None, "--dry-run").stdout.splitlines()
+        self.assertEqual(self.waiting(), 700)
+        with Receiver() as receiver:
+            self.run_forwarder(receiver)
+        self.assertEqual(printed, [request.text for request in receiver.requests])
+
+    def test_nothing_to_deliver_is_no_error(self):
+        with Receiver() as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0)
+            os.remove(self.path)
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0)
+        self.assertEqual(receiver.requests, [])
+        self.assertFalse(os.path.exists(self.path), "the forwarder makes no spool")
+
+    def test_the_rate_is_kept(self):
+        self.add(1200)
+        with Receiver() as receiver:
+            self.run_forwarder(receiver, TESSEL_FORWARD_RATE="1000")
+        times = [request.arrived for request in receiver.requests]
+        self.assertEqual(len(times), 3)
+        # 512 records at 1,000 a second; a little less for the way to the receiver.
+        self.assertGreater(times[1] - times[0], 0.45)
+        self.assertGreater(times[2] - times[1], 0.45)
+
+
+class Trouble(ForwarderTest):
+    def check_retried(self, first, least_wait, **more):
+        """The answer `first`, then acceptance: the same record again after a while."""
+        self.add(3)
+        with Receiver(lambda request, number: first() if number == 0 else Answer()) as receiver:
+            self.assertEqual(self.run_forwarder(receiver, **more).returncode, 0, self.errors)
+        self.assertEqual(len(receiver.requests), 2)
+        self.assertEqual(receiver.requests[0].text, receiver.requests[1].text)
+        self.assertGreater(receiver.requests[1].arrived - receiver.requests[0].arrived, least_wait)
+        self.assertEqual(self.waiting(), 0)
+        self.assertEqual(self.counters()["retries"], 1)
+        self.assertEqual(self.counters()["delivered"], 3)
+
+    def test_busy_collectors_are_tried_again(self):
+        for status in (502, 503, 504):
+            self.setUp()
+            self.check_retried(lambda: Answer(status), 0.4)
+
+    def test_retry_after_in_seconds(self):
+        self.check_retried(lambda: Answer(429, headers={"Retry-After": "2"}), 1.9)
+
+    def test_retry_after_as_a_date(self):
+        # Whole seconds: the date may be almost one second less away than three.
+        self.check_retried(
+            lambda: Answer(429, headers={"Retry-After": email.utils.formatdate(time.time() + 3, usegmt=True)}), 1.9)
+
+    def test_a_connection_that_breaks_in_the_middle(self):
+        self.check_retried(lambda: Answer(200, kind="cut"), 0.4)
+
+    def test_a_collector_that_is_too_slow(self):
+        self.check_retried(lambda: Answer(200, delay=3), 0.9, OTEL_EXPORTER_OTLP_TIMEOUT="500")
+
+    def test_any_success_counts_whatever_its_body(self):
+        for answer in (Answer(201, b""), Answer(200, b"x" * 30_000_000), Answer(202, b"<html>"),
+                       Answer(200, b'{"partialSuccess":{}}')):
+            self.add(3)
+            with Receiver(lambda request, number: answer) as receiver:
+                self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+            self.assertEqual(len(receiver.requests), 1)
+            self.assertEqual(self.waiting(), 0)
+
+    def test_a_partial_success_is_counted_and_never_sent_again(self):
+        self.add(5)
+        body = b'{"partialSuccess":{"rejectedLogRecords":"2","errorMessage":"too old\\n"}}'
+        with Receiver(lambda request, number: Answer(200, body)) as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0)
+        self.assertEqual(len(receiver.requests), 1)
+        self.assertEqual(self.counters()["rejected"], 2)
+        self.assertIn("too old", self.errors)
+        self.assert_all_arrived_once(receiver, 5)
+
+    def test_one_bad_record_is_set_aside_with_the_collectors_words(self):
+        self.add(1000)
+
+        def refuse(request, _):
+            bad = any(uid_of(record).endswith("-345") for record in request.records)
+            return Answer(400, b"attribute Name is bad") if bad else Answer()
+
+        with Receiver(refuse) as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        uids = receiver.accepted_uids()
+        self.assertEqual(uids, [f"{SPOOL_ID}-{number}" for number in range(1, 1001) if number != 345])
+        self.assertLess(len(receiver.requests), 25)
+        self.assertEqual(self.query("SELECT id, payload, status, words FROM forwarder_set_aside"),
+                         [(345, '{"Name":"Open","Number1Value":344}', 400, "400: attribute Name is bad")])
+        self.assertEqual(self.counters()["set_aside"], 1)
+        with Receiver() as receiver:
+            self.run_forwarder(None, "--requeue")
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        self.assertEqual(receiver.accepted_uids(), [f"{SPOOL_ID}-345"])
+        self.assertEqual(self.query("SELECT count(*) FROM forwarder_set_aside"), [(0,)])
+
+    def test_a_row_that_is_no_event_does_not_hold_up_the_others(self):
+        self.add(1)
+        for payload in ("", "[1]", '{"a":{"b":1}}', '{"a":'):
+            self.add(1, payload=payload)
+        self.add(1)
+        with Receiver() as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        self.assertEqual(receiver.accepted_uids(), [SPOOL_ID + "-1", SPOOL_ID + "-6"])
+        self.assertEqual(self.query("SELECT id FROM forwarder_set_aside ORDER BY id"), [(2,), (3,), (4,), (5,)])
+
+    def test_wrong_credentials_or_address_set_nothing_aside(self):
+        self.add(600)
+        with Receiver() as elsewhere:
+            for answer in (Answer(401), Answer(404), Answer(307, headers={"Location": elsewhere.url + "/v1/logs"})):
+                with Receiver(lambda request, number: answer) as receiver:
+                    self.assertEqual(self.run_forwarder(receiver).returncode, 69)
+                self.assertEqual(len(receiver.requests), 1)
+                self.assertIn(str(answer.status), self.errors)
+            self.assertEqual(elsewhere.requests, [], "redirects are not followed")
+        self.assertEqual(self.waiting(), 600)
+
+    def test_a_collector_that_refuses_everything_does_not_empty_the_spool(self):
+        self.add(600)
+        with Receiver(lambda request, number: Answer(500)) as receiver:
+            self.assertEqual(self.run_forwarder(receiver).returncode, 69)
+        self.assertGreater(self.waiting(), 580)
+        self.assertEqual(self.waiting() + self.query("SELECT count(*) FROM forwarder_set_aside")[0][0], 600)
+
+    def test_certificates_are_verified(self):
+        self.add(3)
+        right = make_certificate(self.state, "right")
+        wrong = make_certificate(self.state, "wrong")
+        with Receiver(certificate=right[0], key=right[1]) as receiver:
+            process = subprocess.Popen([FORWARDER], env=self.environment(receiver, OTEL_EXPORTER_OTLP_CERTIFICATE=wrong[0]),
+                                       stderr=subprocess.PIPE, text=True)
+            self.assertIn("certificate", process.stderr.readline())
+            process.terminate()
+            process.communicate(timeout=60)
+            self.assertEqual(receiver.requests, [])
+            self.assertEqual(self.waiting(), 3)
+            result = self.run_forwarder(receiver, OTEL_EXPORTER_OTLP_CERTIFICATE=right[0])
+            self.assertEqual(result.returncode, 0, self.errors)
+        self.assert_all_arrived_once(receiver, 3)
+
+
+class Process(ForwarderTest):
+    def test_settings_that_make_no_sense_are_one_line_and_status_78(self):
+        for name, value in (("OTEL_EXPORTER_OTLP_ENDPOINT", ""), ("OTEL_EXPORTER_OTLP_ENDPOINT", "http://192.0.2.1:4318"),
+                            ("OTEL_EXPORTER_OTLP_ENDPOINT", "ftp://127.0.0.1"), ("OTEL_EXPORTER_OTLP_TIMEOUT", "soon"),
+                            ("OTEL_EXPORTER_OTLP_COMPRESSION", "brotli"), ("OTEL_EXPORTER_OTLP_PROTOCOL", "grpc"),
+                            ("OTEL_EXPORTER_OTLP_HEADERS", "secret"), ("TESSEL_FORWARD_RATE", "-1")):
+            result = self.run_forwarder("http://127.0.0.1:9", **{name: value})
+            self.assertEqual(result.returncode, 78, (name, value))
+            self.assertEqual(len(result.stderr.splitlines()), 1)
+            self.assertIn(name, result.stderr)
+            self.assertEqual("secret" in result.stderr, False)
+
+    def test_it_tells_the_service_manager_and_ends_when_asked(self):
+        self.add(3)
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as manager, Receiver() as receiver:
+            manager.bind(os.path.join(self.state, "notify"))
+            manager.settimeout(60)
+            process = subprocess.Popen([FORWARDER],
+                                       env=self.environment(receiver, NOTIFY_SOCKET=os.path.join(self.state, "notify")))
+            told = ""
+            while "STATUS=Delivered what there was" not in told:
+                told += manager.recv(4096).decode() + "\n"
+            self.assertIn("READY=1", told)
+            self.assertIn("STATUS=Delivered 3, waiting 0, set aside 0", told)
+            self.add(2)  # later events are found on their own
+            while len(receiver.accepted_uids()) < 5:
+                told += manager.recv(4096).decode()
+            process.send_signal(signal.SIGTERM)
+            self.assertEqual(process.wait(60), 0)
+        self.assertEqual(self.waiting(), 0)
+
+    def test_a_spool_that_was_replaced_is_noticed(self):
+        self.add(1)
+        with Receiver() as receiver:
+            process = subprocess.Popen([FORWARDER], env=self.environment(receiver))
+            deadline = time.monotonic() + 60
+            while len(receiver.requests) < 1 or self.waiting():
+                self.assertLess(time.monotonic(), deadline)
+                time.sleep(0.01)
+            for suffix in ("-wal", "", "-shm"):
+                if os.path.exists(self.path + suffix):
+                    os.rename(self.path + suffix, self.path + ".damaged-x" + suffix)
+            make_spool(self.state)
+            self.add(2)
+            while len(receiver.requests) < 2 or self.waiting():
+                self.assertLess(time.monotonic(), deadline)
+                time.sleep(0.01)
+            process.terminate()
+            self.assertEqual(process.wait(60), 0)
+
+    def test_killed_at_any_moment_it_loses_nothing(self):
+        total = 20_000
+        self.add(total)
+        chooser = random.Random()
+        with Receiver() as receiver:
+            for _ in range(50):
+                process = subprocess.Popen([FORWARDER], env=self.environment(receiver))
+                time.sleep(chooser.uniform(0.005, 0.06))
+                process.kill()
+                process.wait()
+                with sqlite3.connect(self.path) as database:
+                    self.assertEqual(database.execute("PRAGMA integrity_check").fetchone()[0], "ok")
+                if self.waiting() < 2000:  # so that every kill finds work
+                    self.add(2000)
+                    total += 2000
+            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
+        texts = {}
+        for request in receiver.requests:
+            for record in request.records:
+                texts.setdefault(uid_of(record), set()).add(json.dumps(record))
+        self.assertEqual(set(texts), {f"{SPOOL_ID}-{number}" for number in range(1, total + 1)})
+        self.assertTrue(all(len(kinds) == 1 for kinds in texts.values()), "the same identifier is the same record")
+
+
+if __name__ == "__main__":
+    unittest.main()
