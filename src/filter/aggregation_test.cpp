@@ -80,6 +80,9 @@ TEST(AggregationTest, OrdersByCountThenByFirstAppearance) {
             (std::vector<std::string>{"a/x 3", "c/x 2", "b/x 1", "z/x 1", "y/x 1"}));
   EXPECT_EQ(aggregation.totalCount(), 8u);
   EXPECT_EQ(count(aggregation, "x", "a"), 0u);
+  // Any key that is equal finds the count.
+  EXPECT_EQ(aggregation.countForKey(key("a", "x")), 3u);
+  EXPECT_EQ(aggregation.countForKey(key("x", "a")), 0u);
 }
 
 TEST(AggregationTest, APairWithAnAbsentStringIsANewEntryEachTime) {
@@ -103,6 +106,15 @@ TEST(AggregationTest, APairWithAnAbsentStringIsANewEntryEachTime) {
     EXPECT_EQ(aggregation.countForKey(*keys[i]), 1u);
     EXPECT_EQ(aggregation.countForKey(Key(*keys[i])), 0u);
   }
+}
+
+TEST(AggregationTest, PairsWithAnAbsentStringDoNotCrowdOutTheOthers) {
+  TesselReporterAggregation aggregation;
+  for (int i = 0; i < 200; ++i) increment(aggregation, nullptr, "c");
+  for (int i = 0; i < 40; ++i) increment(aggregation, "s", std::to_string(i % 20).c_str());
+  EXPECT_EQ(count(aggregation, "s", "0"), 2u);
+  EXPECT_EQ(count(aggregation, "s", "19"), 2u);
+  EXPECT_EQ(aggregation.aggregationDictionary().size(), 220u);
 }
 
 TEST(AggregationTest, KeepsItsStringsAlive) {
