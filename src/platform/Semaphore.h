@@ -14,10 +14,9 @@ class Semaphore {
   explicit Semaphore(uint64_t count) : count_(count) {}
 
   void signal() {
-    {
-      const std::lock_guard lock(mutex_);
-      ++count_;
-    }
+    // Notified under the lock: the waiter may destroy the semaphore as soon as it has the lock.
+    const std::lock_guard lock(mutex_);
+    ++count_;
     condition_.notify_one();
   }
   // Takes one unit; false where none came within `timeout`, measured from the call.
