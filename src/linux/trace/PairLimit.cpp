@@ -1,16 +1,30 @@
 #include "linux/trace/PairLimit.h"
 
+#include <bit>
+
 namespace tessel {
+
+PairLimit::PairLimit(PairLimits limits)
+    : limits_(limits), slots_(std::bit_ceil(2 * limits.pairs + 2)) {}
+
+PairLimit::Pair& PairLimit::slotOf(const Pair& pair) {
+  const size_t mask = slots_.size() - 1;
+  size_t at = (pair[0] + pair[1] * 0x9e3779b97f4a7c15u) & mask;
+  while (slots_[at] != Pair{} && slots_[at] != pair) at = (at + 1) & mask;
+  return slots_[at];
+}
 
 bool PairLimit::admits(StringRef subsystem, StringRef category) {
   const Pair pair{subsystem.hash(), category.hash()};
-  if (pairs_.contains(pair)) return true;
+  Pair& slot = slotOf(pair);
+  if (slot == pair) return true;
   const size_t text = subsystem.textOr("").size() + category.textOr("").size();
-  if (pairs_.size() >= limits_.pairs || textBytes_ + text > limits_.textBytes) {
+  if (count_ >= limits_.pairs || textBytes_ + text > limits_.textBytes) {
     ++refusals_;
     return false;
   }
-  pairs_.insert(pair);
+  slot = pair;
+  ++count_;
   textBytes_ += text;
   return true;
 }

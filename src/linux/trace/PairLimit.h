@@ -9,7 +9,7 @@
 
 #include <array>
 #include <cstdint>
-#include <unordered_set>
+#include <vector>
 
 #include "platform/SharedString.h"
 
@@ -22,21 +22,21 @@ struct PairLimits {
 
 class PairLimit {
  public:
-  explicit PairLimit(PairLimits limits = {}) : limits_(limits) {}
+  explicit PairLimit(PairLimits limits = {});
 
   // Whether the pair is among those let in; lets it in where there is room. Counts a refusal.
   bool admits(StringRef subsystem, StringRef category);
-  size_t pairs() const { return pairs_.size(); }
+  size_t pairs() const { return count_; }
   uint64_t refusals() const { return refusals_; }
 
  private:
   using Pair = std::array<uint64_t, 2>;
-  struct Hash {
-    size_t operator()(const Pair& pair) const { return pair[0] ^ (pair[1] * 0x9e3779b97f4a7c15u); }
-  };
+
+  Pair& slotOf(const Pair& pair);
 
   const PairLimits limits_;
-  std::unordered_set<Pair, Hash> pairs_;
+  std::vector<Pair> slots_;  // open addressing, at most half full; all zero is an empty slot
+  size_t count_ = 0;
   size_t textBytes_ = 0;
   uint64_t refusals_ = 0;
 };

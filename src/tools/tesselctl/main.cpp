@@ -44,6 +44,9 @@ int run(std::vector<std::string> arguments) {
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& error) {
+    if (app.get_subcommands().empty() && !app.remaining().empty()) {
+      return fail(kUsage, "no command is called '" + app.remaining().front() + "'; see --help");
+    }
     return app.exit(error) == 0 ? kDone : kUsage;
   }
   return invocation.status;

@@ -1,0 +1,47 @@
+// Any bytes as a file in the Journal Export Format: read to the end, then read again after the file
+// grew by a good entry, which must come out unless the bytes end within a value.
+
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include <cstdint>
+#include <cstdlib>
+
+#include "linux/trace/ExportEntryStream.h"
+#include "linux/trace/TracePointTable.h"
+
+namespace {
+
+void append(int file, const void* data, size_t size) {
+  if (::pwrite(file, data, size, ::lseek(file, 0, SEEK_END)) != static_cast<ssize_t>(size))
+    std::abort();
+}
+
+void readAll(tessel::ExportEntryStream& stream, const tessel::TracePointTable& table) {
+  while (stream.next()) {
+    for (const tessel::FieldToken token : stream.entry().tokens) {
+      if (table.kind(token) == tessel::FieldKind::name && table.text(token).text().size() > 4096)
+        std::abort();
+    }
+  }
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static const int file = ::memfd_create("export", 0);
+  if (::ftruncate(file, 0) != 0) std::abort();
+  append(file, data, size);
+  // A description of its own, with its own place in the file.
+  const std::string path = "/proc/self/fd/" + std::to_string(file);
+  tessel::TracePointTable table({.fields = 64, .textBytes = 64 * 1024});
+  tessel::StopFlag stop = false;
+  tessel::FileReport report;
+  tessel::ExportEntryStream stream(::open(path.c_str(), O_RDONLY), table, stop, report);
+  readAll(stream, table);
+  constexpr std::string_view kGood = "\n\n__REALTIME_TIMESTAMP=1\nTESSEL_NAME=x\n\n";
+  append(file, kGood.data(), kGood.size());
+  readAll(stream, table);
+  return 0;
+}

@@ -1,0 +1,72 @@
+// Any fields in any entries: decoded and assembled under limits so tight that every one is met.
+//
+// A line of the input is a field, an empty line ends an entry; the first byte of an entry moves the
+// clock and picks the boot.
+
+#include <cstdint>
+#include <cstdlib>
+#include <string_view>
+#include <vector>
+
+#include "linux/trace/IntervalAssembler.h"
+#include "linux/trace/TracePointTable.h"
+
+namespace {
+
+using namespace tessel;
+
+// Keeps the last few objects and reads them when others have long followed.
+class KeepingSink final : public TraceObjectSink {
+ public:
+  bool admits(StringRef subsystem, StringRef category) override {
+    if (!subsystem || !category) std::abort();
+    return true;
+  }
+  void deliverEvent(std::shared_ptr<const TesselEvent> event) override { keep(std::move(event)); }
+  void deliverInterval(std::shared_ptr<const TesselInterval> interval) override {
+    interval->attribute("BundleIdOverride");
+    keep(std::move(interval));
+  }
+  void deliverAnimationInterval(std::shared_ptr<const TesselAnimationInterval> interval) override {
+    keep(std::move(interval));
+  }
+
+ private:
+  void keep(std::shared_ptr<const TesselObject> object) {
+    auto& old = kept_[next_++ % std::size(kept_)];
+    if (old && old->name().hash() != (old->name() ? hashText(old->name().text()) : 0)) std::abort();
+    old = std::move(object);
+  }
+  std::shared_ptr<const TesselObject> kept_[16];
+  size_t next_ = 0;
+};
+
+std::string_view takeLine(std::string_view& rest) {
+  const std::string_view line = rest.substr(0, rest.find('\n'));
+  rest.remove_prefix(std::min(rest.size(), line.size() + 1));
+  return line;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  std::string_view rest(reinterpret_cast<const char*>(data), size);
+  TracePointTable table({.fields = 48, .textBytes = 32 * 1024});
+  KeepingSink sink;
+  IntervalAssembler assembler(table, sink, {.intervals = 8, .attributes = 12});
+  EntryHeader header;
+  while (!rest.empty()) {
+    header.monotonic += static_cast<uint8_t>(rest.front());
+    header.bootId[0] = rest.front() & 1;
+    table.beginEntry();
+    std::vector<FieldToken> tokens;
+    for (std::string_view line = takeLine(rest); !line.empty(); line = takeLine(rest)) {
+      const FieldToken token = table.tokenFor(line.substr(0, kMaxFieldHead), line.size());
+      if (token != kNoToken) tokens.push_back(token);
+    }
+    assembler.consume({header, tokens});
+  }
+  const AssemblyCounts counts = assembler.counts();
+  if (counts.openIntervals > 8) std::abort();
+  return 0;
+}

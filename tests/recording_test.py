@@ -1,0 +1,144 @@
+#!/usr/bin/env python3
+"""From `tesselctl record` and `logger --journald` through a real journal to what the service sends."""
+import os
+import subprocess
+import sys
+import tempfile
+import unittest
+
+import harness
+from harness import BIN, MachineTest
+
+EVENT = "com.vantor.performance.tessel"
+BESIDE_DAEMON = "TESSEL_TEST_BESIDE_DAEMON"
+HERE = os.path.dirname(os.path.abspath(__file__))
+CTL = os.path.join(BIN, "tesselctl")
+
+
+def ctl(*arguments, **kwargs):
+    return subprocess.run([CTL, *arguments], capture_output=True, text=True, check=False, **kwargs)
+
+
+def sent(machine):
+    """(kind, name) of each object that was sent, in order."""
+    payloads = [dict(payload) for name, payload in machine.rows() if name == EVENT]
+    return [(payload["IntervalType"], payload["Name"]) for payload in payloads]
+
+
+def record_one_of_each(*where):
+    """Records through every form of the command; answers what must be sent."""
+    point = ("com.vantor.Calendar", "View")
+    recorded = [
+        ("event", *point, "Open", "--telemetry"),
+        ("event", *point, "Unmarked"),
+        ("begin", *point, "Draw", "--id", "7", "--telemetry"),
+        ("begin", *point, "Slide", "--frame-rate", "60"),
+        ("end", *point, "Draw", "--id", "8"),
+        ("end", *point, "Draw", "--id", "7", "--attribute", "note=two\nlines"),
+        ("end", *point, "Slide", "--telemetry"),
+        ("end", *point, "Backwards", "--duration", "-1", "--telemetry"),
+        ("event", *point, "Control\x1b[31m\nlines", "--telemetry"),
+    ]
+    for arguments in recorded:
+        result = ctl("record", *arguments, *where)
+        assert result.returncode == 0, (arguments, result.stderr)
+    around = ctl("record", *where, "--subsystem", "com.vantor.Backup", "--category", "Job", "--name", "List",
+                 "--telemetry", "--", "sh", "-c", "echo out; exit 7")
+    assert (around.returncode, around.stdout) == (7, "out\n"), around
+    return [("Event", "Open"), ("Interval", "Draw"), ("AnimationInterval", "Slide"),
+            ("Event", "Control\x1b[31m\nlines"), ("Interval", "List")]
+
+
+class Store(MachineTest):
+    def test_an_export_file_is_delivered_as_recorded(self):
+        expected = record_one_of_each("--store", self.machine.store)
+        self.assert_clean(self.machine.run())
+        self.assertEqual(sent(self.machine), expected)
+
+    def test_the_journals_own_tools_take_the_file(self):
+        expected = record_one_of_each("--store", self.machine.store)
+        export = os.path.join(self.machine.store, "tessel.export")
+        journal = os.path.join(self.machine.store, "converted.journal")
+        if not os.path.exists(harness.REMOTE):
+            self.skipTest(harness.REMOTE + " is not installed")
+        subprocess.run([harness.REMOTE, "-o", journal, export], check=True, capture_output=True)
+        os.unlink(export)
+        self.assert_clean(self.machine.run())
+        self.assertEqual(sent(self.machine), expected)
+
+    def test_what_it_was_told_stands_in_place_of_what_is_true(self):
+        common = ("--store", self.machine.store, "--boot", "ab" * 16, "--pid", "12", "--scope", "process")
+        point = ("com.vantor.Calendar", "View", "Long", "--telemetry")
+        self.assertEqual(ctl("record", "begin", *point, *common, "--ago", "100").returncode, 0)
+        self.assertEqual(ctl("record", "end", *point, *common, "--ago", "40", "--comm", "other").returncode, 0)
+        self.assertEqual(ctl("record", "event", *point, *common, "--ago", "90000").returncode, 0)
+        self.assert_clean(self.machine.run())
+        payloads = [dict(payload) for name, payload in self.machine.rows() if name == EVENT]
+        self.assertEqual(len(payloads), 1)
+        self.assertAlmostEqual(payloads[0]["DurationInSeconds"], 60, delta=10)
+
+    def test_many_writers_lose_nothing(self):
+        script = ('for i in $(seq 20); do "$0" record event com.vantor.Calendar View "W$1-$i" --telemetry '
+                  '--store "$2" || exit 1; done')
+        writers = [subprocess.Popen(["sh", "-c", script, CTL, str(writer), self.machine.store]) for writer in range(4)]
+        self.assertEqual([writer.wait() for writer in writers], [0] * 4)
+        self.assert_clean(self.machine.run())
+        self.assertEqual(sorted(sent(self.machine)),
+                         sorted(("Event", f"W{writer}-{i}") for writer in range(4) for i in range(1, 21)))
+
+
+class CommandLine(unittest.TestCase):
+    def test_what_cannot_be_recorded_is_named(self):
+        with tempfile.TemporaryDirectory() as store:
+            for arguments, status, named in (
+                    (["record"], 2, "event, begin or end"),
+                    (["record", "event", "s"], 2, "category"),
+                    (["record", "event", "s", "c", "n" * 4097], 2, "TESSEL_NAME"),
+                    (["record", "event", "s", "c", "--field", "F" * 65 + "=v"], 2, "F" * 65),
+                    (["record", "event", "s", "c", "--field", "_PID=1"], 2, "_PID"),
+                    (["record", "event", "s", "c", "--field", "lower=1"], 2, "lower"),
+                    (["record", "event", "s", "c", "--number1", "n=1,5"], 2, "1,5"),
+                    (["record", "event", "s", "c", "--duration", "1s"], 2, "1s"),
+                    (["record", "end", "s", "c", "--attribute", "=v"], 2, "=v"),
+                    (["record", "end", "s", "c", "--scope", "host"], 2, "scope"),
+                    (["record", "event", "s", "c", "--boot", "x"], 2, "boot id"),
+                    (["record", "event", "s", "c", "--", "true"], 2, "not both"),
+                    (["record", "--", "true"], 2, "--subsystem"),
+                    (["record", "--subsystem", "s", "--category", "c", "--", "/nowhere"], 127, "/nowhere"),
+                    (["nonsense"], 2, "nonsense")):
+                extra = ["--store", store] if arguments[0] == "record" else []
+                at = arguments.index("--") if "--" in arguments else len(arguments)
+                result = ctl(*arguments[:at], *extra, *arguments[at:])
+                self.assertEqual(result.returncode, status, (arguments, result.stderr))
+                self.assertIn(named, result.stderr, arguments)
+        self.assertEqual(ctl("record", "event", "s", "c", "--store", "/proc/nowhere").returncode, 4)
+        self.assertEqual(ctl("record", "event", "s", "c", "--pid", "1").returncode, 2)
+        self.assertEqual(ctl("record", "--help").returncode, 0)
+
+
+class Daemon(MachineTest):
+    """A journal daemon of its own; the whole script runs again beside it."""
+
+    @unittest.skipIf(BESIDE_DAEMON in os.environ, "this is the inner run")
+    def test_a_live_journal_is_delivered_as_recorded(self):
+        result = subprocess.run([os.path.join(HERE, "with-journald"), sys.executable, os.path.abspath(__file__),
+                                 "InsideDaemon"], env={**os.environ, BESIDE_DAEMON: "1"},
+                                capture_output=True, text=True, check=False, timeout=120)
+        if result.returncode == harness.SKIPPED:
+            self.skipTest(result.stderr.strip())
+        self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
+
+
+@unittest.skipUnless(BESIDE_DAEMON in os.environ, "runs beside a daemon only")
+class InsideDaemon(MachineTest):
+    def test_record_and_logger(self):
+        expected = record_one_of_each()
+        fields = ("MESSAGE=tessel\nTESSEL_KIND=event\nTESSEL_SUBSYSTEM=com.vantor.Calendar\nTESSEL_CATEGORY=View\n"
+                  "TESSEL_NAME=Logged\nTESSEL_TELEMETRY=1\n")
+        subprocess.run(["logger", "--journald"], input=fields, text=True, check=True)
+        self.assert_clean(self.machine.run(TESSEL_TRACE_STORE=None))
+        self.assertEqual(sent(self.machine), expected + [("Event", "Logged")])
+
+
+if __name__ == "__main__":
+    harness.main()
