@@ -17,15 +17,15 @@ std::string_view withoutTrailingSeparators(std::string_view path) {
 
 std::string_view lastComponent(std::string_view path) {
   const std::string_view trimmed = withoutTrailingSeparators(path);
-  return trimmed.substr(trimmed.rfind('/') +
-                        1);  // rfind() finding none gives npos, and that plus 1 is 0
+  // Where there is no separator rfind() gives npos, and that plus 1 is 0.
+  return trimmed.substr(trimmed.rfind('/') + 1);
 }
 
 // "/" for a path directly below the root, and empty for a single relative component.
 std::string_view parent(std::string_view path) {
   const std::string_view trimmed = withoutTrailingSeparators(path);
   const size_t separator = trimmed.rfind('/');
-  if (separator == std::string_view::npos) return path.substr(0, path.starts_with('/') ? 1 : 0);
+  if (separator == std::string_view::npos) return {};
   const std::string_view above = withoutTrailingSeparators(trimmed.substr(0, separator));
   return above.empty() ? path.substr(0, 1) : above;
 }
