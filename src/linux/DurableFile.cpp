@@ -28,10 +28,11 @@ bool flushDirectory(const std::string& path) {
 
 }  // namespace
 
-std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text) {
+std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text,
+                                              unsigned permissions) {
   const std::string fresh = path + ".new";
   const UniqueFd file(
-      ::open(fresh.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0640));
+      ::open(fresh.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, permissions));
   if (!file.valid() || !writeAll(file.get(), text) || ::fsync(file.get()) != 0) {
     return lastError(fresh);
   }

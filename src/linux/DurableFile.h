@@ -10,7 +10,9 @@ namespace tessel {
 
 // Makes `path` hold `text`: whoever opens it, at any time and past a power cut, finds all of the
 // old text or all of the new. Writes to `<path>.new` first, which no two callers may do at a time.
+// A new file has `permissions`, as far as the process's mask leaves them.
 // The reason in words where that fails; the old file then still stands.
-std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text);
+std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text,
+                                              unsigned permissions = 0640);
 
 }  // namespace tessel

@@ -34,6 +34,8 @@ class StateDirectory {
   // Makes the directory (mode 0750) where it is missing. The error is one line that names the
   // directory and what is wrong with it: it cannot be made, is none, or cannot be written to.
   static std::variant<StateDirectory, std::string> open(const std::string& path);
+  // The directory for those who only look: neither it nor anything in it is made.
+  static StateDirectory forReading(std::string path) { return StateDirectory(std::move(path)); }
 
   const std::string& path() const { return path_; }
   std::string deferFile() const { return path_ + "/defer"; }

@@ -12,9 +12,6 @@ namespace tessel {
 
 namespace {
 
-constexpr std::string_view kBuildVariantSubsystem = "com.vantor.tessel";
-constexpr char kTaskingType[] = "com.vantor.performance.tessel_reporter_tasking";
-constexpr char kTaskedOnKey[] = "TaskedOn";
 constexpr std::chrono::nanoseconds kConfigurationWait{5'000'000'000};
 
 // What the waiting gate and the callback share; the callback may outlive the gate's call.

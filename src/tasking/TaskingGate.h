@@ -11,6 +11,7 @@
 
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "platform/Analytics.h"
 #include "platform/Clock.h"
@@ -18,6 +19,12 @@
 #include "platform/System.h"
 
 namespace tessel {
+
+// Whose internal diagnostics make a build report without being tasked.
+inline constexpr std::string_view kBuildVariantSubsystem = "com.vantor.tessel";
+// The configuration that tasks, and its key that says so.
+inline constexpr char kTaskingType[] = "com.vantor.performance.tessel_reporter_tasking";
+inline constexpr char kTaskedOnKey[] = "TaskedOn";
 
 class TaskingGate {
  public:
