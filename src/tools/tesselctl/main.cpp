@@ -1,20 +1,16 @@
 // tesselctl: the companion of the service on the command line.
 
 #include <algorithm>
-#include <cstdio>
+#include <memory>
 
 #include "tools/tesselctl/Commands.h"
+#include "tools/tesselctl/ShownText.h"
+#include "tools/tesselctl/Terminal.h"
 
 namespace tessel::ctl {
 
 int fail(ExitStatus status, const std::string& message) {
-  std::string shown = "tesselctl: " + message + "\n";
-  // No text of the outside may move the cursor or change colours.
-  const auto isControl = [](char c) {
-    return (static_cast<unsigned char>(c) < ' ' && c != '\n') || c == 0x7f;
-  };
-  std::replace_if(shown.begin(), shown.end(), isControl, '?');
-  std::fputs(shown.c_str(), stderr);
+  printError("tesselctl: " + terminalText(message) + "\n");
   return status;
 }
 
@@ -23,6 +19,19 @@ namespace {
 constexpr const char* kFooter =
     "Exit status: 0 done; 1 the answer is bad; 2 usage; 4 no access.\n"
     "'tesselctl COMMAND --help' says more about a command.";
+
+// Help that fits 80 columns.
+class NarrowFormatter final : public CLI::Formatter {
+ public:
+  NarrowFormatter() { column_width(kColumn); }
+  std::string make_option_desc(const CLI::Option* option) const override {
+    return wrapped(option->get_description(), kWidth - kColumn, 0);
+  }
+
+ private:
+  static constexpr size_t kColumn = 28;
+  static constexpr size_t kWidth = 80;
+};
 
 // Takes what stands behind "--" off the arguments.
 std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& arguments) {
@@ -39,7 +48,15 @@ int run(std::vector<std::string> arguments) {
   CLI::App app("Records trace points and shows what tessel_reporter makes of them.", "tesselctl");
   app.require_subcommand(1);
   app.footer(kFooter);
+  app.formatter(std::make_shared<NarrowFormatter>());
   addRecordCommand(app, invocation);
+  addExplainCommand(app, invocation);
+  addDeferCommand(app, invocation);
+  addTaskingCommand(app, invocation);
+  if (!arguments.empty() && !arguments[0].starts_with('-') &&
+      app.get_subcommand_no_throw(arguments[0]) == nullptr) {
+    return fail(kUsage, "there is no command '" + arguments[0] + "'; see tesselctl --help");
+  }
   std::reverse(arguments.begin(), arguments.end());  // as the parser wants them
   try {
     app.parse(std::move(arguments));

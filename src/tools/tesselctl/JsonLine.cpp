@@ -1,0 +1,42 @@
+// Members of JSON objects.
+
+#include "tools/tesselctl/JsonLine.h"
+
+#include "tools/tesselctl/ShownText.h"
+
+namespace tessel::ctl {
+
+void appendJsonText(std::string& out, std::string_view text) {
+  std::string literal;
+  appendJsonString(literal, text);
+  out += terminalJson(literal);
+}
+
+JsonObject& JsonObject::text(std::string_view key, std::string_view value) {
+  this->key(key);
+  appendJsonText(out_, value);
+  return *this;
+}
+
+JsonObject& JsonObject::text(std::string_view key, StringRef value) {
+  return value ? text(key, value.text()) : *this;
+}
+
+JsonObject& JsonObject::number(std::string_view key, const Number& value) {
+  return raw(key, numberText(value));
+}
+
+JsonObject& JsonObject::raw(std::string_view key, std::string_view json) {
+  this->key(key);
+  out_ += json;
+  return *this;
+}
+
+void JsonObject::key(std::string_view name) {
+  if (!empty_) out_ += ',';
+  empty_ = false;
+  appendJsonText(out_, name);
+  out_ += ':';
+}
+
+}  // namespace tessel::ctl

@@ -1,0 +1,58 @@
+// Dates and durations as they are given on a command line.
+//
+//   now  today  yesterday
+//   2026-11-22   2026-11-22 21:45   2026-11-22T21:45:00.5   ... with Z or +01:00 behind
+//   21:45  21:45:30        today
+//   @1795379995            seconds since 1970
+//   -24h   24h ago   1h30m ago   2 days ago
+//
+// Without a zone a date is local time. Durations: a number and s, m, h, d or w, or the words for
+// them; several parts add up. Stateless; any thread.
+
+#pragma once
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/Clock.h"
+
+namespace tessel::ctl {
+
+// The date that `text` names, seen from `now`; nothing where it names none.
+std::optional<Date> parseDate(std::string_view text, Date now);
+// Nothing where `text` is no duration, is zero, or is over a thousand years.
+std::optional<std::chrono::microseconds> parseDuration(std::string_view text);
+
+// "2026-11-22 21:45:01", local time.
+std::string dateText(Date date);
+// "21:45:01", local time.
+std::string timeOfDayText(Date date);
+// "3 s", "5 min", "2 h 10 min", "4 days".
+std::string durationText(std::chrono::microseconds duration);
+
+// [start, end)
+struct Period {
+  Date start;
+  Date end;
+  std::chrono::microseconds length() const { return end - start; }
+};
+
+// What --since, --until and --last say; empty where they are not given.
+struct PeriodArguments {
+  std::string since;
+  std::string until;
+  std::string last;
+
+  bool given() const { return !since.empty() || !until.empty() || !last.empty(); }
+};
+
+// The period; without arguments the 24 hours before `now`. The error names argument and value.
+struct PeriodResult {
+  std::optional<Period> period;
+  std::string error;
+};
+PeriodResult periodOf(const PeriodArguments& arguments, Date now);
+
+}  // namespace tessel::ctl
