@@ -56,13 +56,36 @@ std::string_view SqliteStatement::text(int column) const {
   return {bytes, static_cast<size_t>(sqlite3_column_bytes(statement_.get(), column))};
 }
 
+namespace {
+
+std::string immutableUri(const std::string& path) {
+  std::string uri = "file:";
+  for (const char character : path) {
+    if (character == '%') {
+      uri += "%25";
+    } else if (character == '?') {
+      uri += "%3f";
+    } else if (character == '#') {
+      uri += "%23";
+    } else {
+      uri += character;
+    }
+  }
+  return uri + "?immutable=1";
+}
+
+}  // namespace
+
 SqliteStatus SqliteDatabase::open(const std::string& path, Mode mode) {
   close();
   int flags = SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE;
   if (mode == Mode::readOnly) flags |= SQLITE_OPEN_READONLY;
   if (mode == Mode::readWrite) flags |= SQLITE_OPEN_READWRITE;
   if (mode == Mode::create) flags |= SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
-  const int code = sqlite3_open_v2(path.c_str(), &handle_, flags, nullptr);
+  const bool immutable = mode == Mode::immutable;
+  if (immutable) flags |= SQLITE_OPEN_READONLY | SQLITE_OPEN_URI;
+  const std::string name = immutable ? immutableUri(path) : path;
+  const int code = sqlite3_open_v2(name.c_str(), &handle_, flags, nullptr);
   if (code == SQLITE_OK) return {};
   SqliteStatus failure = status();
   failure.code = code;

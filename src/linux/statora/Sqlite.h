@@ -57,7 +57,9 @@ class SqliteStatement {
 
 class SqliteDatabase {
  public:
-  enum class Mode { readOnly, readWrite, create };
+  // immutable: read as it stands, with no look at a write-ahead log and without the files that
+  // other modes make beside it; for one who may only read, while nobody writes.
+  enum class Mode { readOnly, readWrite, create, immutable };
 
   SqliteDatabase() = default;
   SqliteDatabase(const SqliteDatabase&) = delete;

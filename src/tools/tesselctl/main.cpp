@@ -51,10 +51,12 @@ int run(std::vector<std::string> arguments) {
   app.formatter(std::make_shared<NarrowFormatter>());
   addRecordCommand(app, invocation);
   addExplainCommand(app, invocation);
+  addEventsCommand(app, invocation);
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);
   if (!arguments.empty() && !arguments[0].starts_with('-') &&
-      app.get_subcommand_no_throw(arguments[0]) == nullptr) {
+      app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
+          .empty()) {
     return fail(kUsage, "there is no command '" + arguments[0] + "'; see tesselctl --help");
   }
   std::reverse(arguments.begin(), arguments.end());  // as the parser wants them
