@@ -9,7 +9,6 @@ namespace tessel {
 StringSet::StringSet(std::initializer_list<List> lists) {
   size_t entries = 0;
   for (const List& list : lists) entries += list.size();
-  if (entries == 0) return;
   slots_.resize(std::bit_ceil(entries + entries / 2 + 1));
   for (const List& list : lists) {
     for (const std::string_view text : list) add(text);
@@ -28,7 +27,7 @@ void StringSet::add(std::string_view text) {
 }
 
 bool StringSet::contains(StringRef value) const {
-  if (!value.present() || slots_.empty()) return false;
+  if (!value.present()) return false;
   const uint64_t hash = value.hash();
   const size_t mask = slots_.size() - 1;
   for (size_t at = hash & mask; slots_[at].text.data() != nullptr; at = (at + 1) & mask) {

@@ -32,7 +32,7 @@ class StringSet {
   };
   void add(std::string_view text);
 
-  // Open addressing; a power of two with at least one slot free, or none at all.
+  // Open addressing; a power of two, with at least one slot free.
   std::vector<Slot> slots_;
   size_t size_ = 0;
 };
