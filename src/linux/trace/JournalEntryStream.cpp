@@ -108,25 +108,35 @@ void JournalEntryStream::collectTokens() {
     context_.report.addProblem("entry damaged", entryOffset_);
     return;
   }
+  tokens_.resize(count);
+  size_t kept = 0;
   const uint32_t generation = context_.tokenizer.generation();
   for (size_t i = 0; i < count && !context_.stop.load(std::memory_order_relaxed); ++i) {
     const FieldToken token = tokenAt(file_.itemAt(items, i), generation);
-    if (token != kNoToken) tokens_.push_back(token);
+    tokens_[kept] = token;
+    kept += token != kNoToken;
   }
+  tokens_.resize(kept);
 }
 
-// The token of the data object at `offset`. What only this entry refers to is not remembered.
+// The token of the data object at `offset`.
 FieldToken JournalEntryStream::tokenAt(uint64_t offset, uint32_t generation) {
-  const bool fresh = offset >= firstFresh_;
-  const uint64_t key = TokenCache::keyFor(number_, offset);
-  if (!fresh) {
-    if (const auto known = context_.resources.tokens.find(key, generation)) return *known;
+  if (offset < firstFresh_) [[likely]] {
+    const FieldToken known = context_.resources.tokens.find(number_, offset, generation);
+    if (known != TokenCache::kUnknown) [[likely]]
+      return known;
   }
+  return newTokenAt(offset, generation);
+}
+
+// Looks at a data object. What only this entry refers to is not remembered, nor is what is none: it
+// may lie across one that is.
+FieldToken JournalEntryStream::newTokenAt(uint64_t offset, uint32_t generation) {
   const auto data = file_.dataAt(offset, context_.resources.data);
   const auto token = data ? readToken(*data) : std::nullopt;
   if (!token) context_.report.addProblem("data object damaged", offset);
-  if (aligned(offset) && (!fresh || !data || data->entryCount != 1))
-    context_.resources.tokens.store(key, token.value_or(kNoToken), generation);
+  if (data && (offset < firstFresh_ || data->entryCount != 1))
+    context_.resources.tokens.store(number_, offset, generation, token.value_or(kNoToken));
   return token.value_or(kNoToken);
 }
 

@@ -59,6 +59,7 @@ class JournalEntryStream final : public EntryStream {
   void finish();
   void collectTokens();
   FieldToken tokenAt(uint64_t offset, uint32_t generation);
+  FieldToken newTokenAt(uint64_t offset, uint32_t generation);
   std::optional<FieldToken> readToken(const DataObject& data);
   std::optional<FieldToken> decompressToken(const DataObject& data);
   std::optional<FieldToken> textToken(std::span<const uint8_t> head, uint64_t size);

@@ -1,17 +1,17 @@
 // TokenCache: which token a data object of which file has, remembered in a fixed amount of memory.
 //
 // One cache serves all files of a store, so its size depends neither on their number nor on theirs.
-// What falls out is asked for again; what is used often stays, as a pair of slots drops the one
-// that was stored first.
+// A line of it covers one region of a file, with a word for every 64 bytes: no two data objects
+// begin closer together. Values that recur were mostly first used close together, so the lines in
+// use stay few. A region that falls out is asked for again.
 //
 // Threads: one at a time.
 
 #pragma once
 
+#include <algorithm>
 #include <array>
 #include <cstdint>
-#include <optional>
-#include <utility>
 #include <vector>
 
 #include "linux/trace/EntryStream.h"
@@ -20,42 +20,54 @@ namespace tessel {
 
 class TokenCache {
  public:
-  // Names a data object: the number of its file and its offset, a multiple of eight, never 0.
-  static uint64_t keyFor(uint32_t file, uint64_t offset) {
-    return uint64_t{file} << 50 | offset >> 3;
-  }
+  // Answered where nothing is remembered. No token has this value.
+  static constexpr FieldToken kUnknown = UINT32_MAX;
 
-  TokenCache() : pairs_(kPairs) {}
+  TokenCache() : lines_(kLines) {}
 
-  // Drops everything when the generation of the tokens is another than before.
-  std::optional<FieldToken> find(uint64_t key, uint32_t generation) {
-    Pair& pair = pairs_[indexOf(key)];
-    if (pair[0].key == key && pair[0].generation == generation) return pair[0].token;
-    if (pair[1].key != key || pair[1].generation != generation) return std::nullopt;
-    return pair[1].token;
+  // The token of the data object at `offset` of file `file`; kUnknown where it was not stored under
+  // this generation of tokens.
+  FieldToken find(uint32_t file, uint64_t offset, uint32_t generation) const {
+    const uint64_t region = regionOf(file, offset);
+    const Line& line = lines_[lineOf(region)];
+    if (line.region != region || line.generation != generation) return kUnknown;
+    return line.tokens[wordOf(offset)];
   }
-  // REQUIRES: find(key, generation) finds nothing.
-  void store(uint64_t key, FieldToken token, uint32_t generation) {
-    Pair& pair = pairs_[indexOf(key)];
-    pair[1] = std::exchange(pair[0], Slot{key, token, generation});
+  void store(uint32_t file, uint64_t offset, uint32_t generation, FieldToken token) {
+    const uint64_t region = regionOf(file, offset);
+    Line& line = lines_[lineOf(region)];
+    if (line.region != region || line.generation != generation) {
+      line.region = region;
+      line.generation = generation;
+      line.tokens.fill(kUnknown);
+    }
+    line.tokens[wordOf(offset)] = token;
   }
 
  private:
-  static constexpr int kPairBits = 17;
-  static constexpr size_t kPairs = size_t{1} << kPairBits;
+  static constexpr int kLineBits = 14;
+  static constexpr size_t kLines = size_t{1} << kLineBits;
+  static constexpr int kWordShift = 6;
+  static constexpr size_t kWords = 64;
+  static constexpr int kRegionShift = 12;
+  static_assert(kWords << kWordShift == size_t{1} << kRegionShift);
 
-  struct Slot {
-    uint64_t key = 0;
-    FieldToken token = kNoToken;
+  struct Line {
+    uint64_t region = 0;
     uint32_t generation = 0;
+    std::array<FieldToken, kWords> tokens;
   };
-  using Pair = std::array<Slot, 2>;
 
-  static size_t indexOf(uint64_t key) {
-    return static_cast<size_t>(key * 0x9e3779b97f4a7c15u >> (64 - kPairBits));
+  // Never 0, so that an empty line is of no region.
+  static uint64_t regionOf(uint32_t file, uint64_t offset) {
+    return uint64_t{file + 1} << 50 | offset >> kRegionShift;
   }
+  static size_t lineOf(uint64_t region) {
+    return static_cast<size_t>(region * 0x9e3779b97f4a7c15u >> (64 - kLineBits));
+  }
+  static size_t wordOf(uint64_t offset) { return offset >> kWordShift & (kWords - 1); }
 
-  std::vector<Pair> pairs_;
+  std::vector<Line> lines_;
 };
 
 }  // namespace tessel

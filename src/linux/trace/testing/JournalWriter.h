@@ -1,0 +1,62 @@
+// JournalWriter: makes journal files of any layout in memory, for tests only: what the writers of
+// the machine that runs the tests cannot be asked for (XZ, LZ4, old headers, seals), and small
+// files to do damage to.
+
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "linux/trace/EntryStream.h"
+
+namespace tessel::testing {
+
+struct JournalLayout {
+  bool compact = false;
+  uint8_t compression = 0;   // of journal_format::DataFlag
+  size_t compressFrom = 64;  // bytes
+  uint64_t headerSize = 256;
+  uint8_t state = 2;       // of journal_format::FileState
+  unsigned sealEvery = 0;  // entries between two tags; 0: not sealed
+  Id128 sequenceId{7};
+};
+
+class JournalWriter {
+ public:
+  explicit JournalWriter(JournalLayout layout = {});
+
+  // Appends an entry with the sequence number `header` gives, or the next one where that is 0.
+  void add(EntryHeader header, const std::vector<std::string>& fields);
+  // Appends `count` entries of a few fields each, some of them shared, one second apart.
+  void addSome(size_t count, uint64_t firstSequence = 1);
+  // The file as it stands.
+  std::string bytes() const;
+
+  // Offsets of what was written, to aim at.
+  const std::vector<uint64_t>& entries() const { return entries_; }
+  const std::vector<uint64_t>& arrays() const { return arrays_; }
+
+ private:
+  uint64_t beginObject(uint8_t type, uint8_t flags, uint64_t size);
+  uint64_t dataFor(const std::string& field);
+  void link(uint64_t entry);
+  template <typename T>
+  void put(uint64_t at, T value);
+  size_t offsetSize() const { return layout_.compact ? 4 : 8; }
+  void putOffset(uint64_t at, uint64_t offset);
+
+  JournalLayout layout_;
+  std::string file_;
+  std::map<std::string, uint64_t> data_;
+  std::vector<uint64_t> entries_;
+  std::vector<uint64_t> arrays_;
+  uint64_t arrayCapacity_ = 0;
+  uint64_t arrayUsed_ = 0;
+  uint64_t objects_ = 0;
+  uint64_t sequence_ = 0;
+};
+
+}  // namespace tessel::testing

@@ -1,0 +1,229 @@
+// Journals of every layout, read side by side with libsystemd.
+
+#include "linux/trace/TraceStore.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <filesystem>
+
+#include "linux/testing/TemporaryDirectory.h"
+#include "linux/trace/JournalFormat.h"
+#include "linux/trace/testing/JournalOracle.h"
+#include "linux/trace/testing/JournalWriter.h"
+
+namespace tessel {
+namespace {
+
+using ::testing::HasSubstr;
+using testing::JournalLayout;
+using testing::JournalWriter;
+using testing::PlainEntry;
+using testing::TemporaryDirectory;
+
+struct Reading {
+  std::vector<PlainEntry> entries;
+  StoreReport report;
+  std::string error;
+};
+
+Reading readStore(const std::string& path, TimeRange range = {}) {
+  testing::RecordingTokenizer tokenizer;
+  StopFlag stop{false};
+  auto opened = TraceStore::open(path, range, tokenizer, stop);
+  if (auto* error = std::get_if<PlatformError>(&opened))
+    return {{}, {}, error->localizedDescription};
+  TraceStore& store = *std::get<0>(opened);
+  Reading reading;
+  reading.entries = testing::readAll(store.entries(), tokenizer);
+  reading.report = store.report();
+  return reading;
+}
+
+std::vector<uint64_t> numbers(const Reading& reading) {
+  std::vector<uint64_t> all;
+  for (const PlainEntry& entry : reading.entries) all.push_back(entry.header.sequenceNumber);
+  return all;
+}
+
+std::string someJournal(size_t count, uint64_t firstSequence = 1, JournalLayout layout = {}) {
+  JournalWriter writer(layout);
+  writer.addSome(count, firstSequence);
+  return writer.bytes();
+}
+
+// What journal-remote is fed: boots, binary and repeated fields, values large enough to compress.
+std::string exportText(int entries, uint64_t firstMicrosecond, int boots) {
+  std::string text;
+  for (int i = 0; i < entries; ++i) {
+    const std::string number = std::to_string(i);
+    text += "__REALTIME_TIMESTAMP=" +
+            std::to_string(firstMicrosecond + static_cast<uint64_t>(i) * 1000) +
+            "\n__MONOTONIC_TIMESTAMP=" + std::to_string(1000 + i * 1000 / boots) +
+            "\n_BOOT_ID=0123456789abcdef0123456789abcde" + std::to_string(i * boots / entries) +
+            "\nMESSAGE=message " + number + "\n_PID=" + std::to_string(i % 50) + "\nPRIORITY=6\n";
+    if (i % 7 == 0) text += "LARGE=" + std::string(3000 + i % 3000, 'x') + number + "\n";
+    if (i % 9 == 0) text += "TESSEL_ATTRIBUTE=a=" + number + "\nTESSEL_ATTRIBUTE=b=\n";
+    if (i % 11 == 0) text += std::string("BINARY\n\x07\0\0\0\0\0\0\0a\nb\0\n\n\xff\n", 23);
+    text += "\n";
+  }
+  return text;
+}
+
+void makeWithJournalRemote(const std::string& path, const std::string& text, bool compact,
+                           bool keyedHash) {
+  const std::string command = std::string("SYSTEMD_JOURNAL_COMPACT=") + (compact ? "1" : "0") +
+                              " SYSTEMD_JOURNAL_KEYED_HASH=" + (keyedHash ? "1" : "0") +
+                              " /lib/systemd/systemd-journal-remote --compress=yes -o '" + path +
+                              "' - >/dev/null 2>&1";
+  FILE* pipe = ::popen(command.c_str(), "w");
+  ASSERT_NE(pipe, nullptr);
+  std::fwrite(text.data(), 1, text.size(), pipe);
+  ASSERT_EQ(::pclose(pipe), 0);
+}
+
+TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInEveryLayoutOfTheDaemon) {
+  const TemporaryDirectory directory;
+  for (const bool compact : {false, true}) {
+    for (const bool keyedHash : {false, true}) {
+      const std::string path = directory.path("one.journal");
+      makeWithJournalRemote(path, exportText(3000, 1'795'300'000'000'000, 3), compact, keyedHash);
+      const Reading reading = readStore(path);
+      EXPECT_EQ(reading.entries.size(), 3000u);
+      EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({path})) << compact << keyedHash;
+      EXPECT_TRUE(reading.report.files.at(0).problems.empty());
+      std::filesystem::remove(path);
+    }
+  }
+}
+
+TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
+  using namespace journal_format;
+  const JournalLayout layouts[] = {
+      {.compression = kXz},
+      {.compression = kLz4},
+      {.compression = kZstd},
+      {.compact = true, .compression = kXz},
+      {.headerSize = 240},
+      {.headerSize = 256, .state = kOffline},
+      {.headerSize = 264, .state = kOnline},
+      {.headerSize = 272},
+      {.sealEvery = 10},
+      {.compact = true, .compression = kLz4, .headerSize = 272, .sealEvery = 3},
+  };
+  const TemporaryDirectory directory;
+  for (const JournalLayout& layout : layouts) {
+    const std::string path = directory.write("one.journal", someJournal(500, 1, layout));
+    const Reading reading = readStore(path);
+    const size_t number = static_cast<size_t>(&layout - layouts);
+    EXPECT_EQ(reading.entries.size(), 500u) << number;
+    EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({path})) << number;
+    EXPECT_TRUE(reading.report.files.at(0).problems.empty()) << number;
+  }
+}
+
+TEST(TraceStoreTest, MergesOverlappingFilesAsLibsystemdDoes) {
+  const TemporaryDirectory directory;
+  const std::string a = directory.path("a.journal"), b = directory.path("sub/b.journal");
+  std::filesystem::create_directory(directory.path("sub"));
+  makeWithJournalRemote(a, exportText(1000, 1'795'300'000'000'000, 1), true, true);
+  makeWithJournalRemote(b, exportText(1000, 1'795'300'000'333'000, 1), false, false);
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 2000u);
+  EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({a, b}));
+}
+
+TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
+  const TemporaryDirectory directory;
+  directory.write("a.journal", someJournal(20, 1));
+  directory.write("b.journal", someJournal(20, 11));
+  directory.write("c.journal", someJournal(5, 15));
+  JournalWriter twice({.sequenceId = {9}});
+  twice.addSome(1, 1);
+  twice.addSome(1, 1);
+  directory.write("twice.journal", twice.bytes());
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 32u);
+  EXPECT_EQ(reading.report.entriesRead, 32u);
+  EXPECT_EQ(reading.report.duplicateEntries, 15u);
+}
+
+TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
+  const TemporaryDirectory directory;
+  constexpr uint64_t kBase = 1'795'300'000'000'000;
+  directory.write("a.journal", someJournal(10, 1));
+  directory.write("b.journal", someJournal(10, 11));
+  directory.write("live.journal", someJournal(5, 30, {.state = journal_format::kOnline}));
+  const Reading reading = readStore(directory.path(), {kBase + 13'000'000, kBase + 16'000'000});
+  EXPECT_EQ(numbers(reading), (std::vector<uint64_t>{13, 14, 15}));
+  EXPECT_EQ(reading.report.files.at(0).skipped, "outside the range");
+  EXPECT_EQ(reading.report.files.at(1).entriesRead, 3u);
+  EXPECT_FALSE(reading.report.files.at(2).skipped);
+  EXPECT_EQ(reading.report.oldestEntry, kBase + 1'000'000);
+  EXPECT_TRUE(reading.report.reachesRangeStart());
+}
+
+TEST(TraceStoreTest, TellsGapsInTheSequence) {
+  const TemporaryDirectory directory;
+  directory.write("a.journal", someJournal(10, 1));
+  directory.write("b.journal", someJournal(10, 14));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.report.sequenceGaps, 1u);
+  EXPECT_EQ(reading.report.missingEntries, 3u);
+}
+
+TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
+  const TemporaryDirectory directory;
+  JournalWriter writer;
+  EntryHeader header;
+  header.realtime = header.monotonic = 1;
+  const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  writer.add(header, {message, "N_DROPPED=12", "OBJECT_SYSTEMD_UNIT=a.service"});
+  writer.add(header, {"MESSAGE_ID=other", "N_DROPPED=100", "OBJECT_SYSTEMD_UNIT=a.service"});
+  writer.add(header, {message, "N_DROPPED=5", "OBJECT_SYSTEMD_UNIT=a.service", "PRIORITY=4"});
+  writer.add(header, {message, "N_DROPPED=1"});
+  const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
+  ASSERT_EQ(reading.report.dropped.size(), 2u);
+  EXPECT_EQ(reading.report.dropped[0].unit, "a.service");
+  EXPECT_EQ(reading.report.dropped[0].count, 17u);
+  EXPECT_EQ(reading.report.dropped[1].unit, "");
+  EXPECT_EQ(reading.report.dropped[1].count, 1u);
+  EXPECT_EQ(reading.entries.at(2).fields, (std::vector<std::string>{"PRIORITY=4"}));
+}
+
+TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
+  const TemporaryDirectory directory;
+  const std::string noise = directory.write("noise/noise.journal", std::string(5000, '\x5a'));
+  EXPECT_THAT(readStore("/nowhere").error, HasSubstr("/nowhere: No such file"));
+  EXPECT_THAT(readStore(noise).error, HasSubstr(noise + ": not a journal file"));
+  EXPECT_THAT(readStore(directory.path("noise")).error, HasSubstr("not a journal file"));
+  std::filesystem::create_directory(directory.path("empty"));
+  EXPECT_THAT(readStore(directory.path("empty")).error, HasSubstr("holds no *.journal"));
+  EXPECT_THAT(readStore("/dev/null").error, HasSubstr("neither a directory nor a file"));
+}
+
+TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {
+  const TemporaryDirectory directory;
+  directory.write("bad.journal", std::string(5000, '\x5a'));
+  directory.write("empty.journal", "");
+  directory.write("good.journal~", someJournal(10));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  EXPECT_EQ(reading.report.files.at(0).skipped, "not a journal file");
+  EXPECT_EQ(reading.report.files.at(1).skipped, "it is empty");
+}
+
+TEST(TraceStoreTest, ReadsAFileOfSeveralNamesOnce) {
+  const TemporaryDirectory directory;
+  const std::string path = directory.write("a.journal", someJournal(10));
+  std::filesystem::create_hard_link(path, directory.path("b.journal"));
+  std::filesystem::create_symlink(path, directory.path("c.journal"));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  EXPECT_EQ(reading.report.files.size(), 1u);
+}
+
+}  // namespace
+}  // namespace tessel
