@@ -38,8 +38,14 @@ Id128 loadId(const uint8_t* at) {
   return id;
 }
 
-// Where the objects end: with the arena, or with the file where the arena claims more or grows.
-uint64_t endOfObjects(const JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
+// Where the objects end: with the arena, or with the file where the arena claims more or grows. A
+// header of a damaged size is followed by objects all the same.
+uint64_t endOfObjects(JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
+  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
+      header.headerSize > std::min(fileSize, kMaxHeaderSize)) {
+    header.headerSize = kMinHeaderSize;
+    return fileSize;
+  }
   if (header.beingWritten() || arenaSize > fileSize - header.headerSize) return fileSize;
   return header.headerSize + arenaSize;
 }
@@ -57,10 +63,6 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   header.state = at[kStateAt];
   header.sequenceId = loadId(at + kSequenceIdAt);
   header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
-  // A header of a damaged size is followed by objects all the same.
-  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
-      header.headerSize > std::min<uint64_t>(fileSize, 4096))
-    header.headerSize = kMinHeaderSize;
   header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
   // While a file is written, what lies behind its last object is not yet an object.
   const auto lastObject = load<uint64_t>(at + kTailObjectAt);

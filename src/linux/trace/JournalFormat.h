@@ -19,6 +19,8 @@ inline constexpr char kSignature[9] = "LPKSHHRH";
 
 // The shortest header that is understood; what newer writers append is optional.
 inline constexpr uint64_t kMinHeaderSize = 208;
+// A header that claims more than this is damaged.
+inline constexpr uint64_t kMaxHeaderSize = 4096;
 
 enum IncompatibleFlag : uint32_t {
   kCompressedXz = 1,
