@@ -17,6 +17,9 @@ namespace {
 // The forwarder has time; the service goes first.
 constexpr int kPatienceMilliseconds = 5000;
 
+// Few enough that the service, whose next send may come at any moment, has no need to wait.
+constexpr size_t kRowsRemovedAtOnce = 128;
+
 constexpr char kTables[] =
     "BEGIN IMMEDIATE;"
     "CREATE TABLE IF NOT EXISTS forwarder(name TEXT PRIMARY KEY, value INTEGER NOT NULL) WITHOUT "
@@ -69,8 +72,10 @@ bool ForwarderState::exists() const {
 SqliteStatus ForwarderState::open() {
   if (database_.isOpen() && isStillThere()) return {};
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
-  // A lost acknowledgement is no lost event, so none is flushed.
-  if (status.ok()) status = database_.execute("PRAGMA synchronous=NORMAL");
+  // A lost acknowledgement is no lost event, so none is flushed. The write-ahead log, which grows
+  // here, is emptied here, before the service comes to do it in the middle of a send.
+  if (status.ok())
+    status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
   if (status.ok() &&
       !database_.integer("SELECT 1 FROM sqlite_schema WHERE name='forwarder_set_aside'")) {
     status = database_.execute(kTables);
@@ -174,11 +179,20 @@ SqliteStatus ForwarderState::finish(bool good) {
 }
 
 SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, Date now) {
+  counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
+  while (!ids.empty()) {
+    const auto step = ids.first(std::min(ids.size(), kRowsRemovedAtOnce));
+    if (SqliteStatus status = remove(step); !status.ok()) return status;
+    ids = ids.subspan(step.size());
+  }
+  return {};
+}
+
+SqliteStatus ForwarderState::remove(std::span<const int64_t> ids) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
   counters_.delivered += ids.size();
   counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
-  counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
   SqliteStatus status =
       finish(std::all_of(ids.begin(), ids.end(),
                          [this](int64_t id) { return remove_.bind(1, id).run(); }) &&

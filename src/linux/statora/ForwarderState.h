@@ -1,14 +1,14 @@
 // ForwarderState: the spool as the forwarder sees it, and what the forwarder keeps in it.
 //
-// A row of `events` is there until a collector has taken it: acknowledging deletes the rows and
-// moves the counters in one transaction, so that a forwarder that dies in between sends them again
-// under the same identifiers and nothing is lost. Beside `events` stand
+// A row of `events` is there until a collector has taken it. Acknowledging removes rows, oldest
+// first, and moves the counters in one transaction, so that a forwarder that dies before it sends
+// them again under the same identifiers, and nothing is lost. Beside `events` stand
 //
 //   forwarder            name and value of each counter
 //   forwarder_set_aside  rows that the collector refused, with when, its status and its words
 //
-// No transaction here is longer than one batch, and none flushes the disk (a lost acknowledgement
-// only repeats a delivery), so that the service's sends wait a few milliseconds for it at most.
+// Rows are removed in small steps, each a transaction of its own, and none flushes the disk (a lost
+// acknowledgement only repeats a delivery), so that the service's sends hardly ever wait for it.
 //
 // Threads: one at a time.
 
@@ -76,6 +76,7 @@ class ForwarderState {
 
   // The counters to be stored with the next acknowledgement or setting aside.
   ForwarderCounters& counters() { return counters_; }
+  // Counts the rows as delivered and removes them.
   SqliteStatus acknowledge(std::span<const int64_t> ids, Date now);
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
                         Date now);
@@ -90,6 +91,7 @@ class ForwarderState {
   SqliteStatus openFresh(SqliteDatabase::Mode mode);
   SqliteStatus prepareStatements();
   bool isStillThere() const;
+  SqliteStatus remove(std::span<const int64_t> ids);
   bool writeCounters();
   SqliteStatus finish(bool good);
 

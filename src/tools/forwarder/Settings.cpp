@@ -11,6 +11,7 @@
 #include <functional>
 #include <memory>
 #include <string_view>
+#include <utility>
 
 #include "linux/Files.h"
 
@@ -22,6 +23,11 @@ constexpr size_t kMaxCredentialBytes = 64 * 1024;
 
 using Headers = std::vector<std::string>;
 
+struct Variable {
+  std::string name;
+  std::string value;
+};
+
 // Reads variables and remembers the first that makes no sense.
 class Variables {
  public:
@@ -29,19 +35,19 @@ class Variables {
 
   // A variable that is set to nothing counts as one that is not set.
   std::optional<std::string> value(const std::string& name) const {
-    auto text = environment_(name);
-    return text && text->empty() ? std::nullopt : text;
+    std::optional<std::string> text = environment_(name);
+    if (text && text->empty()) text.reset();
+    return text;
   }
-  // OTEL_EXPORTER_OTLP_LOGS_<name>, else OTEL_EXPORTER_OTLP_<name>; answers which one is set.
-  std::optional<std::string> standardName(const std::string& name) const {
+  // OTEL_EXPORTER_OTLP_LOGS_<name>, else OTEL_EXPORTER_OTLP_<name>.
+  std::optional<Variable> standard(const std::string& name) const {
     for (const char* prefix : {"OTEL_EXPORTER_OTLP_LOGS_", "OTEL_EXPORTER_OTLP_"}) {
-      if (value(prefix + name)) return prefix + name;
+      if (auto text = value(prefix + name)) return Variable{prefix + name, std::move(*text)};
     }
     return {};
   }
   std::string path(const std::string& name) const {
-    const auto variable = standardName(name);
-    return variable ? *value(*variable) : std::string();
+    return standard(name).value_or(Variable{}).value;
   }
   void complain(const std::string& name, const std::string& text, const char* expected) {
     if (!error_) error_ = LaunchError{name, text, expected};
@@ -60,8 +66,8 @@ class Variables {
     return {};
   }
   bool flag(const std::string& name) {
-    const auto text = value(name);
-    if (text && *text != "0" && *text != "1") complain(name, *text, "0 or 1");
+    const std::string text = value(name).value_or("0");
+    if (text != "0" && text != "1") complain(name, text, "0 or 1");
     return text == "1";
   }
   const std::optional<LaunchError>& error() const { return error_; }
@@ -142,19 +148,19 @@ bool acceptable(const std::string& text, bool allowHttp) {
 
 void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   const bool allowHttp = variables.flag("TESSEL_FORWARD_ALLOW_HTTP");
-  const auto name = variables.standardName("ENDPOINT");
-  if (!name) {
+  const auto endpoint = variables.standard("ENDPOINT");
+  if (!endpoint) {
     variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
     return;
   }
-  settings.url = *variables.value(*name);
-  if (*name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
+  settings.url = endpoint->value;
+  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
     while (settings.url.ends_with('/')) settings.url.pop_back();
     settings.url += "/v1/logs";
   }
   if (!acceptable(settings.url, allowHttp)) {
     variables.complain(
-        *name, *variables.value(*name),
+        endpoint->name, endpoint->value,
         "an https URL, or an http one to loopback (to any host with TESSEL_FORWARD_ALLOW_HTTP=1)");
   }
 }
@@ -184,21 +190,21 @@ void readCredentials(Variables& variables, ForwarderSettings& settings) {
 }
 
 void readTransport(Variables& variables, ForwarderSettings& settings) {
-  if (const auto name = variables.standardName("HEADERS")) {
-    addHeaders(variables, settings, *name, *variables.value(*name));
+  if (const auto headers = variables.standard("HEADERS")) {
+    addHeaders(variables, settings, headers->name, headers->value);
   }
-  if (const auto name = variables.standardName("TIMEOUT")) {
-    settings.timeout =
-        std::chrono::milliseconds{variables.number(*name, 1).value_or(settings.timeout.count())};
+  if (const auto timeout = variables.standard("TIMEOUT")) {
+    settings.timeout = std::chrono::milliseconds{variables.number(timeout->name, 1).value_or(1)};
   }
-  if (const auto name = variables.standardName("COMPRESSION")) {
-    const std::string text = *variables.value(*name);
-    settings.compress = text == "gzip";
-    if (text != "gzip" && text != "none") variables.complain(*name, text, "gzip or none");
+  if (const auto compression = variables.standard("COMPRESSION")) {
+    settings.compress = compression->value == "gzip";
+    if (!settings.compress && compression->value != "none") {
+      variables.complain(compression->name, compression->value, "gzip or none");
+    }
   }
-  if (const auto name = variables.standardName("PROTOCOL");
-      name && variables.value(*name) != "http/json") {
-    variables.complain(*name, *variables.value(*name),
+  if (const auto protocol = variables.standard("PROTOCOL");
+      protocol && protocol->value != "http/json") {
+    variables.complain(protocol->name, protocol->value,
                        "http/json, the one protocol that is spoken here");
   }
   settings.authorities = variables.path("CERTIFICATE");
