@@ -18,7 +18,7 @@ namespace tessel {
 
 class ByteWindow {
  public:
-  static constexpr size_t kCapacity = 128 * 1024;
+  static constexpr size_t kCapacity = 131'072;
 
   // Takes the descriptor and closes it. A wait for a pipe ends soon after `stop` is set.
   ByteWindow(int fd, const StopFlag& stop);

@@ -26,7 +26,7 @@ class ExportEntryStream final : public EntryStream {
   static constexpr uint64_t kMaxValueLength = 768ull * 1024 * 1024;
   // Most that is kept of one entry, of the fields that the tokenizer wants.
   static constexpr size_t kMaxFieldsKept = 1024;
-  static constexpr size_t kMaxBytesKept = 1024 * 1024;
+  static constexpr size_t kMaxBytesKept = size_t{1024} * 1024;
 
   // Takes the descriptor and closes it. Problems are added to `report`; its entries are not
   // counted.

@@ -25,8 +25,8 @@ namespace {
 constexpr std::string_view kEntryStart = "\n\n__CURSOR=";
 constexpr std::string_view kEntryEnd = "\n\n";
 // How much of the end of a file is searched for the last entry, at first and at most.
-constexpr off_t kFirstLook = 64 * 1024;
-constexpr off_t kLastLook = 4 * 1024 * 1024;
+constexpr off_t kFirstLook = off_t{64} * 1024;
+constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
 
 uint64_t microsecondsOf(clockid_t clock) {
   timespec now{};

@@ -25,8 +25,10 @@ std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fie
   // The library answers success where there is no daemon.
   if (::access(kSocket, W_OK) != 0) return failure(errno);
   std::vector<std::string> texts;
+  texts.reserve(fields.size());
   for (const RecordedField& field : fields) texts.push_back(field.name + "=" + field.value);
   std::vector<iovec> parts;
+  parts.reserve(fields.size());
   for (std::string& text : texts) parts.push_back({text.data(), text.size()});
   const int result = ::sd_journal_sendv(parts.data(), static_cast<int>(parts.size()));
   if (result < 0) return failure(-result);

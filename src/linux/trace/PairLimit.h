@@ -17,7 +17,7 @@ namespace tessel {
 
 struct PairLimits {
   size_t pairs = 4096;
-  size_t textBytes = 4 * 1024 * 1024;  // of all subsystems and categories together
+  size_t textBytes = size_t{4} * 1024 * 1024;  // of all subsystems and categories together
 };
 
 class PairLimit {

@@ -33,8 +33,8 @@ class TokenHolder {
 };
 
 struct TracePointTableLimits {
-  size_t fields = 512 * 1024;          // distinct values
-  size_t textBytes = 6 * 1024 * 1024;  // of interned text, its bookkeeping included
+  size_t fields = size_t{512} * 1024;          // distinct values
+  size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
 };
 
 class TracePointTable final : public FieldTokenizer {
