@@ -42,7 +42,7 @@
 #include "trace_journal.h"
 
 #define TESSEL_KEY_MAX 64        /* bytes of an attribute key */
-#define TESSEL_ATTRIBUTES_MAX 64 /* attributes of one trace point */
+#define TESSEL_ATTRIBUTES_MAX 32 /* attributes of one trace point */
 
 #ifdef __cplusplus
 extern "C" {

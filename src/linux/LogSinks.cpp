@@ -9,6 +9,7 @@
 #include <systemd/sd-journal.h>
 
 #include "linux/Files.h"
+#include "linux/MessageIds.h"
 #include "linux/PlainText.h"
 
 namespace tessel {
@@ -26,9 +27,12 @@ std::vector<std::string> journalFields(LogLevel level, std::string_view subsyste
                                        std::string_view category, std::string_view text) {
   // Syslog's numbers for error and debug.
   const char* priority = level == LogLevel::error ? "3" : "7";
-  return {"MESSAGE=" + std::string(text), "PRIORITY=" + std::string(priority),
-          "LOG_SUBSYSTEM=" + std::string(subsystem), "LOG_CATEGORY=" + std::string(category),
-          "SYSLOG_IDENTIFIER=tessel_reporter"};
+  std::vector<std::string> fields{
+      "MESSAGE=" + std::string(text), "PRIORITY=" + std::string(priority),
+      "LOG_SUBSYSTEM=" + std::string(subsystem), "LOG_CATEGORY=" + std::string(category),
+      "SYSLOG_IDENTIFIER=tessel_reporter"};
+  if (const auto id = messageIdOf(text)) fields.push_back("MESSAGE_ID=" + std::string(*id));
+  return fields;
 }
 
 void JournalLog::write(LogLevel level, std::string_view subsystem, std::string_view category,

@@ -55,6 +55,8 @@ TEST(JournalLogTest, AnEntryKeepsTheTextAndCannotLookLikeATracePoint) {
                           "LOG_SUBSYSTEM=com.vantor.TesselSupport", "LOG_CATEGORY=tessel_reporter",
                           "SYSLOG_IDENTIFIER=tessel_reporter"));
   EXPECT_THAT(journalFields(LogLevel::error, "", "", ""), ::testing::Contains("PRIORITY=3"));
+  EXPECT_THAT(journalFields(LogLevel::debug, "", "", "Bailing due to cookie file"),
+              ::testing::Contains("MESSAGE_ID=88bc816f3d5048b0ace67b9e33914435"));
 }
 
 bool isJournal(const std::unique_ptr<LogSink>& sink) {
