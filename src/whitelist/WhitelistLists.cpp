@@ -1005,7 +1005,7 @@ constexpr std::string_view kLaunchSourceValues[] = {
 constexpr std::string_view kCameraValues[] = {
     "CameraLaunchIconTouch",
     "CameraLaunchWithoutPrewarm",
-    "StillImageIntakeNow",
+    "StillImageCaptureNow",
     "modeChange",
     "2,1,0,0",
     "2,1,0,1",

@@ -72,19 +72,34 @@ TEST(WhitelistListsTest, OrdersAndPrefixesHold) {
   EXPECT_EQ(launchSourceValues()[30], "YES");
   EXPECT_EQ(launchSourceValues()[31], "NO");
 
-  std::vector<std::string> modes;
+  std::vector<std::string> camera{"CameraLaunchIconTouch", "CameraLaunchWithoutPrewarm",
+                                  "StillImageCaptureNow", "modeChange"};
   for (const char a : {'2', '3', '4'}) {
     for (const char b : {'1', '2'}) {
       for (const char c : {'0', '1'}) {
-        for (const char d : {'0', '1'}) modes.push_back({a, ',', b, ',', c, ',', d});
+        for (const char d : {'0', '1'}) camera.push_back({a, ',', b, ',', c, ',', d});
       }
     }
   }
-  EXPECT_TRUE(std::ranges::equal(cameraValues().subspan(4), modes));
-  EXPECT_EQ(cameraValues()[3], "modeChange");
-  EXPECT_TRUE(std::ranges::equal(
-      periodViewValues(),
-      std::vector<std::string_view>{"day", "week", "month", "year", "list", "unknown"}));
+  EXPECT_TRUE(std::ranges::equal(cameraValues(), camera));
+
+  const struct {
+    StringList list;
+    std::vector<std::string_view> values;
+  } shortLists[] = {
+      {commonWhitelistValues(), {"Root", "Ext"}},
+      {periodViewValues(), {"day", "week", "month", "year", "list", "unknown"}},
+      {sizeValues(), {"small", "medium", "large", "none"}},
+      {generationSourceValues(), {"generationContext", "file", "generator", "cache"}},
+  };
+  for (const auto& row : shortLists) EXPECT_TRUE(std::ranges::equal(row.list, row.values));
+  for (const char* action :
+       {"Activate", "Open", "Close", "Enter", "Exit", "Collapse", "Launch", "Quit", "minimize"}) {
+    EXPECT_GE(std::ranges::count(perfLoggingActionNames(), action), 1) << action;
+  }
+  for (const char* value : {"Unknown", "Failure"}) {
+    EXPECT_EQ(std::ranges::count(fileSystemScanValues(), value), 1) << value;
+  }
   EXPECT_EQ(mailAccountKindValues()[8], "imap");
   EXPECT_EQ(mailAccountKindValues()[9], "pop");
 }
