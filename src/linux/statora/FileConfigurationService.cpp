@@ -2,7 +2,6 @@
 
 #include "linux/statora/FileConfigurationService.h"
 
-#include <fcntl.h>
 #include <poll.h>
 #include <sys/eventfd.h>
 #include <sys/inotify.h>
@@ -12,11 +11,12 @@
 #include <array>
 #include <cerrno>
 #include <chrono>
-#include <optional>
 #include <system_error>
 #include <thread>
 #include <utility>
 
+#include "linux/Files.h"
+#include "linux/UniqueFd.h"
 #include "linux/statora/ConfigurationChanges.h"
 
 namespace tessel {
@@ -25,40 +25,13 @@ namespace {
 
 constexpr std::chrono::milliseconds kLookInterval{250};
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int descriptor) : descriptor_(descriptor) {}
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  ~FileDescriptor() {
-    if (descriptor_ >= 0) ::close(descriptor_);
-  }
-  int get() const { return descriptor_; }
-
- private:
-  const int descriptor_;
-};
-
-std::optional<std::string> readAtMost(int file, size_t limit) {
-  std::string text;
-  std::array<char, 4096> buffer{};
-  for (;;) {
-    const ssize_t count = ::read(file, buffer.data(), buffer.size());
-    if (count == 0) return text;
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return {};
-    text.append(buffer.data(), static_cast<size_t>(count));
-    if (text.size() > limit) return {};
-  }
-}
-
+// What stands at the path.
 ConfigurationFile readFile(const std::string& path) {
-  // Without blocking, as it may be a pipe.
-  const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-  if (file.get() < 0) return {errno != ENOENT && errno != ENOTDIR, {}};
+  auto text = readSmallFile(path, FileConfigurationService::kMaxFileBytes);
+  if (text) return {true, std::move(text)};
   struct stat facts {};
-  if (::fstat(file.get(), &facts) != 0 || !S_ISREG(facts.st_mode)) return {true, {}};
-  return {true, readAtMost(file.get(), FileConfigurationService::kMaxFileBytes)};
+  const bool missing = ::stat(path.c_str(), &facts) != 0 && (errno == ENOENT || errno == ENOTDIR);
+  return {!missing, {}};
 }
 
 // What the watching thread works on. Shared with the observer, which only ends it.
@@ -71,8 +44,8 @@ struct Watch {
   const std::string directory;
   const std::string type;
   const std::string path;
-  const FileDescriptor inotify{::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)};
-  const FileDescriptor ended{::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)};
+  const UniqueFd inotify{::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)};
+  const UniqueFd ended{::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)};
 
   // Watches the directory that the path leads to now. The kernel knows a directory that is watched
   // already, and forgets one that is gone.

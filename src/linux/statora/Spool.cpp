@@ -13,6 +13,7 @@
 #include <numeric>
 #include <utility>
 
+#include "linux/UniqueFd.h"
 #include "linux/statora/SpoolDatabase.h"
 #include "platform/Log.h"
 
@@ -58,10 +59,8 @@ bool renameAll(const std::string& from, const std::string& to) {
 }
 
 void flushDirectory(const std::string& path) {
-  const int directory = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  if (directory < 0) return;
-  fsync(directory);
-  ::close(directory);
+  const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (directory.valid()) fsync(directory.get());
 }
 
 }  // namespace

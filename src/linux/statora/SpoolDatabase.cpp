@@ -9,6 +9,8 @@
 
 #include "linux/UniqueFd.h"
 
+#include "linux/UniqueFd.h"
+
 namespace tessel {
 
 namespace {
@@ -43,6 +45,13 @@ SqliteStatus upgrade(SqliteDatabase& database) {
   return status;
 }
 
+// SQLite makes files that the group cannot write, as which the forwarder comes; the files that it
+// adds later have the mode of this one. Closed before SQLite opens it: closing a file gives up
+// every lock that the process has on it.
+void makeFile(const std::string& path) {
+  const UniqueFd made(::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0660));
+}
+
 SqliteStatus prepareSchema(SqliteDatabase& database) {
   const auto version = database.integer("PRAGMA user_version");
   if (!version) return database.status();
@@ -61,6 +70,7 @@ SqliteStatus prepareSchema(SqliteDatabase& database) {
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds) {
   makeFileForGroup(path);
+  makeFile(path);
   SqliteStatus status = database.open(path, SqliteDatabase::Mode::create);
   if (!status.ok()) return status;
   database.setBusyTimeout(busyTimeoutMilliseconds);

@@ -148,6 +148,18 @@ TEST_F(SpoolTest, GoesOnWhereAnEarlierProcessEndedAndKeepsItsIdentifier) {
   }
 }
 
+TEST_F(SpoolTest, TheGroupMayWriteAsFarAsTheUmaskLetsIt) {
+  const mode_t before = umask(0007);
+  Spool spool(directory_.path(), clock_);
+  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  umask(before);
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    struct stat facts {};
+    ASSERT_EQ(stat((directory_.path(kSpoolFileName) + suffix).c_str(), &facts), 0);
+    EXPECT_EQ(facts.st_mode & 0777, 0660u) << suffix;
+  }
+}
+
 TEST_F(SpoolTest, AnotherSpoolTakesItsPlaceAfterTheRunWhereTheFirstWasRemoved) {
   Spool spool(directory_.path(), clock_);
   EXPECT_TRUE(spool.sendEvent("a", numbered(1)));

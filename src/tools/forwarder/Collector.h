@@ -3,6 +3,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -20,7 +21,7 @@ struct CollectorAnswer {
 
 class Collector {
  public:
-  static constexpr size_t kMaxAnswerBytes = 64 * 1024;
+  static constexpr size_t kMaxAnswerBytes = size_t{64} << 10;
 
   virtual ~Collector() = default;
   // Sends one request and waits for its answer, as long as the settings allow.

@@ -20,6 +20,8 @@ namespace {
 
 using Json = nlohmann::json;
 
+constexpr size_t kMaxOsReleaseBytes = size_t{64} << 10;
+
 // Members that are always floating-point, also where their digits look like an integer's.
 constexpr std::string_view kFloatingKeys[] = {"DurationInSeconds", "FrameRate",
                                               "ProcessingDurationInSeconds"};
@@ -127,7 +129,7 @@ std::string architectureName() {
 }  // namespace
 
 ResourceFacts readResourceFacts(const std::string& osReleasePath) {
-  const std::string text = readSmallFile(osReleasePath, 64 * 1024).value_or("");
+  const std::string text = readSmallFile(osReleasePath, kMaxOsReleaseBytes).value_or("");
   return {TESSEL_VERSION,
           osReleaseValue(text, "NAME"),
           osReleaseValue(text, "VERSION_ID"),
@@ -136,8 +138,8 @@ ResourceFacts readResourceFacts(const std::string& osReleasePath) {
 }
 
 std::optional<std::string> applicationInstanceId() {
-  constexpr sd_id128_t kApplication =
-      SD_ID128_MAKE(6b, 1d, 0a, 5c, 9e, 3f, 4f, 0c, 8b, 61, d2, 77, 3a, 90, e4, 15);
+  constexpr sd_id128_t kApplication{{0x6b, 0x1d, 0x0a, 0x5c, 0x9e, 0x3f, 0x4f, 0x0c, 0x8b, 0x61,
+                                     0xd2, 0x77, 0x3a, 0x90, 0xe4, 0x15}};
   sd_id128_t id{};
   if (sd_id128_get_machine_app_specific(kApplication, &id) < 0) return {};
   char text[SD_ID128_UUID_STRING_MAX];

@@ -19,7 +19,7 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxCredentialBytes = 64 * 1024;
+constexpr size_t kMaxCredentialBytes = size_t{64} << 10;
 
 using Headers = std::vector<std::string>;
 
