@@ -81,8 +81,10 @@ def have(program):
     return shutil.which(program) or os.path.exists(program)
 
 
-def in_namespace_argv(var_tmp, command):
-    script = 'mount --bind "$0" /var/tmp && exec "$@"'
+def in_namespace_argv(var_tmp, command, read_only=()):
+    script = 'mount --bind "$0" /var/tmp && '
+    script += "".join(f"mount --bind {path} {path} && mount -o remount,bind,ro {path} && " for path in read_only)
+    script += 'exec "$@"'
     unshare = ["unshare", "--mount"] if os.geteuid() == 0 else ["unshare", "--user", "--map-root-user", "--mount"]
     return unshare + ["--", "sh", "-c", script, var_tmp] + command
 
@@ -96,6 +98,7 @@ class Machine:
             os.path.join(self.root, name) for name in ("store", "state", "config", "var_tmp"))
         for folder in (self.store, self.state, self.config, self.var_tmp):
             os.mkdir(folder)
+        self.read_only = []  # directories that the programs cannot write to, whoever runs them
         self.now = time.time()
         self.os_release = os.path.join(self.root, "os-release")
         self.set_internal(False)
@@ -145,7 +148,7 @@ class Machine:
 
     def start(self, program="tessel_reporter", *arguments, **extra):
         """Starts a program; what it prints goes to files that result() reads."""
-        command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments])
+        command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments], self.read_only)
         output = tempfile.TemporaryFile()
         errors = tempfile.TemporaryFile()
         process = subprocess.Popen(command, env=self.environment(**extra), stdout=output, stderr=errors,

@@ -57,6 +57,19 @@ class Launch(MachineTest):
             self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
             self.assertFalse(self.machine.marker_exists())
 
+    def test_a_state_directory_that_cannot_be_written_to_costs_the_events_and_is_said(self):
+        self.machine.write_journal(some_points(3))
+        self.machine.read_only.append(self.machine.state)
+        result = self.machine.run()
+        self.assert_clean(result)
+        for beginning in ("Spool ", "Could not record the run: "):
+            said = [line for line in result.log if line.startswith(beginning)]
+            self.assertEqual(len(said), 1, result.log)
+            self.assertIn(self.machine.state, said[0])
+        self.assertTrue(any(line.startswith("Done processing 3 reported") for line in result.log), result.log)
+        self.assertEqual(os.listdir(self.machine.state), [])
+        self.assertFalse(self.machine.marker_exists())
+
     def test_a_damaged_file_among_good_ones_costs_that_file_alone(self):
         self.machine.write_journal(some_points(3))
         with open(os.path.join(self.machine.store, "b.journal"), "wb") as file:

@@ -21,7 +21,6 @@ namespace tessel {
 namespace {
 
 constexpr mode_t kDirectoryMode = 0750;
-constexpr mode_t kFileMode = 0640;
 constexpr size_t kMaxRecordSize = 64;
 
 // A slash at the end would pass for a name of its own when the directory above is looked for.
@@ -42,10 +41,9 @@ int makeDirectory(const std::string& path) {
   return S_ISDIR(facts.st_mode) ? 0 : ENOTDIR;
 }
 
-UniqueFd openLockFile(const std::string& directory) {
-  const std::string path = directory + "/lock";
-  return UniqueFd(
-      ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, kFileMode));
+// For flock(): the directory itself, which can be locked also where it cannot be written to.
+UniqueFd openForLocking(const std::string& directory) {
+  return UniqueFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
 }
 
 }  // namespace
@@ -54,20 +52,17 @@ std::variant<StateDirectory, std::string> StateDirectory::open(const std::string
   const std::string plain = withoutTrailingSlashes(path);
   const std::string shown = "state directory " + plainText(plain, "\\x0a") + ": ";
   if (const int error = makeDirectory(plain)) return shown + errorWords(error);
-  if (!openLockFile(plain).valid()) {
-    const int error = errno;
-    return shown + "cannot open its file \"lock\": " + errorWords(error);
-  }
+  if (!openForLocking(plain).valid()) return shown + errorWords(errno);
   return StateDirectory(plain);
 }
 
 std::optional<RunLock> StateDirectory::lock(int operation) const {
-  UniqueFd file = openLockFile(path_);
-  if (!file.valid()) return {};
-  while (::flock(file.get(), operation) != 0) {
+  UniqueFd directory = openForLocking(path_);
+  if (!directory.valid()) return {};
+  while (::flock(directory.get(), operation) != 0) {
     if (errno != EINTR) return {};
   }
-  return RunLock(std::move(file));
+  return RunLock(std::move(directory));
 }
 
 std::optional<RunLock> StateDirectory::tryLock() const { return lock(LOCK_EX | LOCK_NB); }

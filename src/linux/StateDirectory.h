@@ -1,10 +1,12 @@
 // StateDirectory: the directory for what outlives the process, and the scheduler's files in it.
 //
-//   lock                held with flock() by the process that has a run, for as long as it has it;
-//                       always empty
 //   scheduler-last-run  when the last run began: microseconds since 1970 in decimal and a line
 //                       feed; replaced as a whole, by the holder of the lock only
 //   defer               made and removed by others: while anything is there, runs are deferred
+//
+// The process that has a run holds the directory itself with flock(), for as long as it has it. One
+// that cannot be written to serves all the same: a run then loses its record and its events, and
+// says so.
 //
 // Immutable once opened; any thread may use it.
 
@@ -23,16 +25,16 @@ namespace tessel {
 // Holds the right to run until it is destroyed or the process ends.
 class RunLock {
  public:
-  explicit RunLock(UniqueFd file) : file_(std::move(file)) {}
+  explicit RunLock(UniqueFd directory) : directory_(std::move(directory)) {}
 
  private:
-  UniqueFd file_;  // closing it releases the lock
+  UniqueFd directory_;  // closing it releases the lock
 };
 
 class StateDirectory {
  public:
   // Makes the directory (mode 0750) where it is missing. The error is one line that names the
-  // directory and what is wrong with it: it cannot be made, is none, or cannot be written to.
+  // directory and what is wrong with it: it cannot be made, is none, or cannot be read.
   static std::variant<StateDirectory, std::string> open(const std::string& path);
   // The directory for those who only look: neither it nor anything in it is made.
   static StateDirectory forReading(std::string path) { return StateDirectory(std::move(path)); }
@@ -42,7 +44,7 @@ class StateDirectory {
 
   // The right to run; nothing where another holder has it.
   std::optional<RunLock> tryLock() const;
-  // Waits for the right to run. Nothing where the lock file cannot be opened or locked.
+  // Waits for the right to run. Nothing where the directory cannot be opened or locked.
   std::optional<RunLock> waitForLock() const;
 
   // When the last run began; nothing where none is recorded or the record cannot be understood.
