@@ -1,5 +1,6 @@
 #!/usr/bin/env python3
 """From `tesselctl record` and `logger --journald` through a real journal to what the service sends."""
+import json
 import os
 import subprocess
 import sys
@@ -138,6 +139,26 @@ class InsideDaemon(MachineTest):
         subprocess.run(["logger", "--journald"], input=fields, text=True, check=True)
         self.assert_clean(self.machine.run(TESSEL_TRACE_STORE=None))
         self.assertEqual(sent(self.machine), expected + [("Event", "Logged")])
+        self.log_to_the_journal(len(expected) + 1)
+
+    def log_to_the_journal(self, delivered):
+        """A service that logs to the journal that it reads meets its own lines there: none is a trace point."""
+        for run in (1, 2):
+            result = self.machine.run(TESSEL_TRACE_STORE=None, TESSEL_LOG="journal")
+            self.assert_clean(result)
+            self.assertEqual(result.errors, "")
+            self.assertEqual(len(sent(self.machine)), delivered * (run + 1))
+        subprocess.run(["journalctl", "--sync"], check=True)
+        output = subprocess.run(["journalctl", "-o", "json", "-t", "tessel_reporter"], check=True, capture_output=True)
+        lines = [json.loads(line) for line in output.stdout.splitlines()]
+        messages = [line["MESSAGE"].rstrip("\n") for line in lines if isinstance(line["MESSAGE"], str)]
+        self.assertEqual(messages.count("Checking in"), 2)
+        self.assertEqual(len([text for text in messages if text.startswith("Done processing ")]), 2)
+        self.assertEqual(messages[-1], "Cleared cookie file")
+        for line in lines:
+            self.assertEqual((line["LOG_SUBSYSTEM"], line["LOG_CATEGORY"], line["PRIORITY"]),
+                             ("com.vantor.TesselSupport", "tessel_reporter", "7"))
+            self.assertEqual([key for key in line if key.startswith("TESSEL_")], [])
 
 
 if __name__ == "__main__":
