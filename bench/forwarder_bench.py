@@ -56,13 +56,14 @@ class Handler(socketserver.StreamRequestHandler):
                 line = self.rfile.readline()
             self.server.bytes.value += len(self.rfile.read(length))
             self.server.requests.value += 1
+            self.server.last.value = time.monotonic()
             self.wfile.write(b"HTTP/1.1 200 OK\r\nContent-Length: 2\r\n\r\n{}")
 
 
-def serve(port, total, requests):
+def serve(port, total, requests, last):
     with socketserver.ThreadingTCPServer(("127.0.0.1", 0), Handler) as server:
         server.daemon_threads = True
-        server.bytes, server.requests = total, requests
+        server.bytes, server.requests, server.last = total, requests, last
         port.value = server.server_address[1]
         server.serve_forever()
 
@@ -96,15 +97,15 @@ def fill(path, events):
         database.executemany("INSERT INTO events(time, name, payload) VALUES(?, ?, ?)", rows())
 
 
-def deliver(forwarder, state, port, gzip):
+def deliver(forwarder, state, port, gzip, last):
     environment = {"TESSEL_STATE_DIR": state, "TESSEL_FORWARD_RATE": "0", "TESSEL_LOG": "stderr",
                    "OTEL_EXPORTER_OTLP_ENDPOINT": f"http://127.0.0.1:{port}",
                    "OTEL_EXPORTER_OTLP_COMPRESSION": "gzip" if gzip else "none"}
     before = resource.getrusage(resource.RUSAGE_CHILDREN)
-    start = time.perf_counter()
+    start = time.monotonic()
     subprocess.run([forwarder, "--once"], env=environment, check=True,
                    preexec_fn=lambda: os.sched_setaffinity(0, {0}))
-    wall = time.perf_counter() - start
+    wall = last.value - start
     after = resource.getrusage(resource.RUSAGE_CHILDREN)
     return wall, after.ru_utime + after.ru_stime - before.ru_utime - before.ru_stime, after.ru_maxrss
 
@@ -117,7 +118,8 @@ def main():
     arguments = parser.parse_args()
     forwarder = os.path.join(arguments.bin, "statora_forwarder")
     port, total, requests = (multiprocessing.Value("q", 0) for _ in range(3))
-    server = multiprocessing.Process(target=serve, args=(port, total, requests), daemon=True)
+    last = multiprocessing.Value("d", 0)  # when the last request had arrived
+    server = multiprocessing.Process(target=serve, args=(port, total, requests, last), daemon=True)
     server.start()
     while not port.value:
         time.sleep(0.01)
@@ -130,7 +132,7 @@ def main():
         total.value = requests.value = 0
         for _ in range(arguments.rounds):
             fill(path, arguments.events)
-            wall, processor, peak = deliver(forwarder, state, port.value, gzip)
+            wall, processor, peak = deliver(forwarder, state, port.value, gzip, last)
             walls.append(wall)
             processors.append(processor)
         sent = arguments.events * arguments.rounds
@@ -145,7 +147,7 @@ def main():
         waits, stop = manager.list(), multiprocessing.Event()
         writer = multiprocessing.Process(target=write_events, args=(path, stop, waits))
         writer.start()
-        deliver(forwarder, state, port.value, True)
+        deliver(forwarder, state, port.value, True, last)
         stop.set()
         writer.join()
         ordered = sorted(waits)

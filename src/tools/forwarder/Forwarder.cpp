@@ -11,8 +11,11 @@ namespace tessel {
 
 namespace {
 
-// Small enough that the service never waits for it to be noticed.
+// Free space is given back in steps that are over before the service would notice, with room for
+// its sends between them, and no more of them at a time than new events can wait for.
 constexpr int kPagesGivenBackAtOnce = 64;
+constexpr int kStepsAtOnce = 50;
+constexpr std::chrono::milliseconds kBetweenSteps{20};
 
 }  // namespace
 
@@ -41,7 +44,8 @@ ForwarderOutcome Forwarder::deliverAll() {
     }
     sayProgress();
   }
-  while (world_.state.shrink(kPagesGivenBackAtOnce)) {
+  for (int step = 0; step < kStepsAtOnce; ++step) {
+    if (!world_.state.shrink(kPagesGivenBackAtOnce) || !takeBreak(kBetweenSteps)) break;
   }
   return ForwarderOutcome::delivered;
 }
