@@ -55,6 +55,7 @@ RunRecord recordFrom(const Json& json) {
   record.inspected = json.at("inspected").get<uint64_t>();
   record.classified =
       json.at("classified").get<std::array<uint64_t, RunRecord::kClassifications>>();
+  record.unnamed = json.at("unnamed").get<uint64_t>();
   record.countEvents = json.at("count_events").get<uint64_t>();
   record.rowsStored = json.at("rows_stored").get<uint64_t>();
   record.rowsFailed = namedFrom(json.at("rows_failed"));
@@ -72,9 +73,11 @@ bool RunRecord::objectsBalance() const {
   return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
 }
 
-bool RunRecord::rowsBalance() const {
-  return rowsStored == 2 * classified[kReported] + countEvents + 1;
+uint64_t RunRecord::rowsExpected() const {
+  return 2 * classified[kReported] - unnamed + countEvents + 1;
 }
+
+bool RunRecord::rowsBalance() const { return rowsStored == rowsExpected(); }
 
 std::optional<std::string> RunRecord::write(const std::string& stateDirectory) const {
   Json json;
@@ -85,6 +88,7 @@ std::optional<std::string> RunRecord::write(const std::string& stateDirectory) c
   json["log_events"] = logEvents;
   json["inspected"] = inspected;
   json["classified"] = classified;
+  json["unnamed"] = unnamed;
   json["count_events"] = countEvents;
   json["rows_stored"] = rowsStored;
   json["rows_failed"] = named(rowsFailed);

@@ -36,16 +36,20 @@ struct RunRecord {
   uint64_t logEvents = 0;  // entries read, trace points or not
   uint64_t inspected = 0;  // trace objects
   std::array<uint64_t, kClassifications> classified{};  // trace objects by classification code
-  uint64_t countEvents = 0;                             // sent or tried
-  uint64_t rowsStored = 0;                              // in the spool
-  Named rowsFailed;                   // by reason; kept without those that are zero
+  uint64_t unnamed = 0;      // reported objects without a name, which send one event instead of two
+  uint64_t countEvents = 0;  // sent or tried
+  uint64_t rowsStored = 0;   // in the spool
+  Named rowsFailed;          // by reason; kept without those that are zero
   std::vector<std::string> setAside;  // damaged spools, by file name
   Named store;                        // facts about the trace store, by name, in order
   std::string marker;                 // what became of the run marker, in words
 
   // Whether every inspected object has exactly one classification.
   bool objectsBalance() const;
-  // Whether the spool has what the run sent: two rows an object reported, the counts, the summary.
+  // How many rows the run should have stored.
+  uint64_t rowsExpected() const;
+  // Whether the spool has what the run sent: two rows an object reported, one where
+  // it has no name, the counts, the summary.
   bool rowsBalance() const;
 
   // The reason in words where the record cannot be written.

@@ -20,8 +20,9 @@ RunRecord mixedDay() {
   record.logEvents = 18'446'744'073'709'551'615u;
   record.inspected = 21;
   record.classified = {1, 2, 3, 4, 5, 6};
+  record.unnamed = 1;
   record.countEvents = 7;
-  record.rowsStored = 12;
+  record.rowsStored = 11;
   record.rowsFailed = {{"locked", 1}, {"disk_full", 2}};
   record.setAside = {"statora.db.damaged-20261118T110640Z"};
   record.store = {{"files", 3}, {"entries", 1000}};

@@ -39,6 +39,7 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
                               object->category(), object->name());
     return true;
   }
+  if (!object->name()) ++unnamedCount_;
   send(object, std::make_shared<const Payload>(*std::move(payload)));
   return true;
 }

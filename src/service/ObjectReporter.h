@@ -6,6 +6,7 @@
 
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <optional>
 
@@ -47,6 +48,8 @@ class ObjectReporter {
 
   // Always true.
   bool reportTesselObject(const std::shared_ptr<const TesselObject>& object);
+  // Reported objects without a name, for which one event is sent instead of two.
+  uint64_t unnamedCount() const { return unnamedCount_; }
 
  private:
   void send(const std::shared_ptr<const TesselObject>& object,
@@ -55,6 +58,7 @@ class ObjectReporter {
   const EventRoad road_;
   const std::shared_ptr<TesselReporterObjectFilter> filter_;
   const BootVolumeFacts bootVolume_;
+  uint64_t unnamedCount_ = 0;
 };
 
 }  // namespace tessel

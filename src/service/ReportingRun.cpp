@@ -62,7 +62,8 @@ RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   const uint64_t startTime = clock.continuousTicks();
   const auto extractor = makeExtractor_();
   const auto filter = TesselReporterObjectFilter::init(surroundings_.buildVariant);
-  installCallbacks(*extractor, makeObjectReporter(filter));
+  const auto reporter = makeObjectReporter(filter);
+  installCallbacks(*extractor, reporter);
   extractor->setBuildAnimationCompositeIntervalTimelines(false);
   const auto interruptedByDeferral = std::make_shared<std::atomic<bool>>(false);
   const Date startDate = clock.now() - kLookBack;
@@ -77,6 +78,7 @@ RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   });
   report.ending = failure ? RunEnding::extractionFailed : RunEnding::completed;
   report.failure = failure.value_or("");
+  report.unnamed = reporter->unnamedCount();
   report.filter = filter;
   report.extractor = extractor;
   report.interruptedByDeferral = *interruptedByDeferral;

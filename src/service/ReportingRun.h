@@ -35,7 +35,8 @@ struct RunReport {
   RunEnding ending = RunEnding::notTasked;
   Date began{};
   Date ended{};
-  std::string failure;  // why the extraction failed; empty where it did not
+  std::string failure;   // why the extraction failed; empty where it did not
+  uint64_t unnamed = 0;  // reported objects that have no event of their own name
   uint64_t countEvents = 0;
   std::shared_ptr<const TesselReporterObjectFilter> filter;
   std::shared_ptr<const TesselSupportObjectExtractor> extractor;

@@ -90,6 +90,7 @@ RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
   record.outcome = outcomeOf(report);
   record.failure =
       report.ending == RunEnding::noMarker ? "the run marker could not be made" : report.failure;
+  record.unnamed = report.unnamed;
   record.countEvents = report.countEvents;
   if (report.filter) addObjects(record, *report.filter);
   if (report.extractor) record.logEvents = report.extractor->processedEventCount();

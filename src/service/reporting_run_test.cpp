@@ -183,6 +183,7 @@ TEST_F(ReportingRunTest, AnObjectWithoutANameSendsTheFixedEventAlone) {
   perform();
   EXPECT_EQ(sender.names().at(0), "com.vantor.performance.tessel");
   EXPECT_EQ(sender.names().at(1), "com.vantor.performance.tessel_counts");
+  EXPECT_EQ(reports.back().unnamed, 1u);
 }
 
 TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
