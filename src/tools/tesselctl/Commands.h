@@ -32,8 +32,11 @@ int fail(ExitStatus status, const std::string& message);
 // Each adds its subcommand. `app` and `invocation` live until the program ends.
 void addRecordCommand(CLI::App& app, Invocation& invocation);
 void addExplainCommand(CLI::App& app, Invocation& invocation);
+void addCompareCommand(CLI::App& app, Invocation& invocation);
 void addEventsCommand(CLI::App& app, Invocation& invocation);
+void addStatusCommand(CLI::App& app, Invocation& invocation);
 void addDeferCommand(CLI::App& app, Invocation& invocation);
 void addTaskingCommand(CLI::App& app, Invocation& invocation);
+void addReportCommand(CLI::App& app, Invocation& invocation);
 
 }  // namespace tessel::ctl

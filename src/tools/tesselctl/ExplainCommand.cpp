@@ -167,7 +167,7 @@ class HumanLines {
  private:
   size_t timeWidth() const { return withDay_ ? 16 : 10; }
   std::string indented(const std::string& text, size_t indent) const {
-    const size_t room = std::max(terminal_.width, indent + 20) - indent;
+    const size_t room = std::max(terminal_.width, indent + 12) - indent;
     std::string out = wrapped(text, room, 0);
     for (size_t at = out.find('\n'); at != std::string::npos;
          at = out.find('\n', at + indent + 1)) {
@@ -197,9 +197,7 @@ class ExplainRun {
     if (options.payload) payloads_ = std::make_unique<PayloadBuilder>();
   }
 
-  int explain() {
-    return options_.follow ? follow() : readOnce();
-  }
+  int explain() { return options_.follow ? follow() : readOnce(); }
 
  private:
   void inspect(const TesselObject& object, const EntryHeader& entry) {

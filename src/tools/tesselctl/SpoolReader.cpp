@@ -23,6 +23,11 @@ uint64_t sizeOf(const std::string& path) {
   return ::stat(path.c_str(), &facts) == 0 ? static_cast<uint64_t>(facts.st_size) : 0;
 }
 
+bool forbids(const SqliteStatus& status) {
+  const int code = status.primaryCode();
+  return code == SQLITE_CANTOPEN || code == SQLITE_PERM || code == SQLITE_READONLY;
+}
+
 }  // namespace
 
 SpoolReader::SpoolReader(const std::string& stateDirectory)
@@ -61,7 +66,7 @@ SpoolReader::State SpoolReader::openDatabase() {
     database_.close();
   }
   // Without a write-ahead log nobody is writing, so nothing is missed by not looking for one.
-  if (status.primaryCode() == SQLITE_CANTOPEN && sizeOf(path_ + "-wal") == 0) {
+  if (forbids(status) && sizeOf(path_ + "-wal") == 0) {
     status = database_.open(path_, SqliteDatabase::Mode::immutable);
     if (status.ok() && database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)"))
       return State::open;
@@ -69,10 +74,7 @@ SpoolReader::State SpoolReader::openDatabase() {
     database_.close();
   }
   reason_ = path_ + ": " + status.reason;
-  const bool forbidden = status.primaryCode() == SQLITE_CANTOPEN ||
-                         status.primaryCode() == SQLITE_PERM ||
-                         status.primaryCode() == SQLITE_READONLY;
-  return forbidden ? State::noAccess : State::damaged;
+  return forbids(status) ? State::noAccess : State::damaged;
 }
 
 bool SpoolReader::readNew(const std::function<bool(const SpoolRow&)>& visit) {

@@ -80,8 +80,10 @@ void writeIntervals(std::string& out, const AssemblyCounts& counts) {
 }
 
 std::string verdictTable(const Tally& tally, const Terminal& terminal) {
-  Table table(
-      {{"VERDICT"}, {"OBJECTS", Table::Align::right}, {"", Table::Align::right}, {"MEANING"}});
+  Table table({{"VERDICT"},
+               {"OBJECTS", Table::Align::right},
+               {"", Table::Align::right},
+               {"MEANING", Table::Align::left, true}});
   for (const auto verdict : kVerdictOrder) {
     const uint64_t count = tally.verdicts()[verdict];
     if (count == 0 && verdict == TesselReporterClassificationClassNotSupported) continue;

@@ -51,9 +51,12 @@ int run(std::vector<std::string> arguments) {
   app.formatter(std::make_shared<NarrowFormatter>());
   addRecordCommand(app, invocation);
   addExplainCommand(app, invocation);
+  addCompareCommand(app, invocation);
   addEventsCommand(app, invocation);
+  addStatusCommand(app, invocation);
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);
+  addReportCommand(app, invocation);
   if (!arguments.empty() && !arguments[0].starts_with('-') &&
       app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
           .empty()) {

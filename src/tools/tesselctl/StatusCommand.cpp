@@ -1,0 +1,393 @@
+// status: does this machine report, and do the books balance?
+
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <memory>
+
+#include "linux/DeferralConditions.h"
+#include "linux/Files.h"
+#include "linux/RunRecord.h"
+#include "linux/StateDirectory.h"
+#include "linux/SystemClock.h"
+#include "linux/trace/TracePointTable.h"
+#include "linux/trace/TraceStore.h"
+#include "service/CookieFile.h"
+#include "tools/tesselctl/Environment.h"
+#include "tools/tesselctl/JsonLine.h"
+#include "tools/tesselctl/ShownText.h"
+#include "tools/tesselctl/SpoolReader.h"
+#include "tools/tesselctl/Tasking.h"
+#include "tools/tesselctl/Terminal.h"
+#include "tools/tesselctl/TimeArguments.h"
+#include "tools/tesselctl/Verdict.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+constexpr std::chrono::hours kLookBack{24};  // of a run
+
+struct Marker {
+  bool present = false;
+  std::string owner;
+  Date since{};
+};
+
+struct JournalFacts {
+  std::optional<Date> oldest;
+  std::string failure;  // why it cannot be read; empty where it can
+};
+
+struct Status {
+  Date now{};
+  Tasking tasking;
+  std::string taskingWords;
+  std::optional<std::string> deferral;  // why one is wanted
+  Marker marker;
+  std::optional<RunRecord> run;
+  std::optional<Date> lastBegin;  // of the last run, recorded or not
+  SpoolReader::State spoolState = SpoolReader::State::absent;
+  std::string spoolFailure;
+  SpoolContents spool;
+  std::string store;
+  JournalFacts journal;
+
+  // A run that got as far as sending anything.
+  bool hasBooks() const {
+    return run &&
+           (run->outcome == RunOutcome::completed || run->outcome == RunOutcome::interrupted);
+  }
+  bool good() const {
+    if (run && run->outcome == RunOutcome::failed) return false;
+    if (hasBooks() && (!run->objectsBalance() || !run->rowsBalance())) return false;
+    return spoolState != SpoolReader::State::damaged;
+  }
+  bool keepsADay() const { return journal.oldest && *journal.oldest <= now - kLookBack; }
+  // The scheduler knows of a run that left no record.
+  bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
+};
+
+Marker lookForMarker() {
+  struct stat facts {};
+  Marker marker;
+  if (::lstat(cookieFilePath, &facts) != 0) return marker;
+  marker.present = true;
+  marker.since = Date{std::chrono::seconds{facts.st_mtim.tv_sec}};
+  const passwd* user = ::getpwuid(facts.st_uid);
+  marker.owner = user != nullptr ? user->pw_name : std::to_string(facts.st_uid);
+  return marker;
+}
+
+JournalFacts lookAtJournal(const std::optional<std::string>& store) {
+  TracePointTable table;
+  const StopFlag stop = false;
+  auto opened = TraceStore::open(store, TimeRange{}, table, stop);
+  JournalFacts facts;
+  if (const auto* error = std::get_if<PlatformError>(&opened)) {
+    facts.failure = error->localizedDescription;
+    return facts;
+  }
+  auto& trace = *std::get<std::unique_ptr<TraceStore>>(opened);
+  trace.entries().next();  // files whose headers do not tell show their first entry
+  if (const auto oldest = trace.report().oldestEntry) {
+    facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};
+  }
+  return facts;
+}
+
+Status gather(const LaunchConfiguration& launch) {
+  const StateDirectory state = StateDirectory::forReading(launch.stateDirectory);
+  Status status;
+  status.now = SystemClock().now();
+  status.tasking = askTasking(launch);
+  status.taskingWords = taskingWords(status.tasking, launch);
+  status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
+  status.marker = lookForMarker();
+  status.run = RunRecord::read(launch.stateDirectory);
+  status.lastBegin = state.lastRun();
+  SpoolReader spool(launch.stateDirectory);
+  status.spoolState = spool.open();
+  if (status.spoolState == SpoolReader::State::open) {
+    const auto contents = spool.contents();
+    if (!contents) status.spoolState = SpoolReader::State::damaged;
+    status.spool = contents.value_or(SpoolContents{});
+  }
+  status.spoolFailure = spool.reason();
+  status.store = storeName(launch.traceStore);
+  status.journal = lookAtJournal(launch.traceStore);
+  return status;
+}
+
+void addDate(JsonObject& object, std::string_view key, std::optional<Date> date) {
+  if (date) object.number(key, Number{int64_t{date->time_since_epoch().count()}});
+}
+
+void writeRun(std::string& out, const RunRecord& run, bool hasBooks) {
+  JsonObject object(out);
+  addDate(object, "start", run.start);
+  addDate(object, "end", run.end);
+  object.text("outcome", std::string_view(runOutcomeName(run.outcome)));
+  if (!run.failure.empty()) object.text("failure", std::string_view(run.failure));
+  object.count("log_events", run.logEvents).count("inspected", run.inspected);
+  for (const auto verdict : kVerdictOrder)
+    object.count(verdictName(verdict), run.classified[verdict]);
+  object.count("unnamed", run.unnamed).count("count_events", run.countEvents);
+  object.count("rows_stored", run.rowsStored)
+      .count("rows_expected", hasBooks ? run.rowsExpected() : 0);
+  object.nested("rows_failed", [&](std::string& inner) {
+    JsonObject failed(inner);
+    for (const auto& [reason, count] : run.rowsFailed) failed.count(reason, count);
+    failed.end();
+  });
+  if (hasBooks)
+    object.boolean("objects_balance", run.objectsBalance())
+        .boolean("rows_balance", run.rowsBalance());
+  object.end();
+}
+
+void writeSpool(std::string& out, const Status& status) {
+  static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
+  JsonObject object(out);
+  object.text("state", kStates[static_cast<size_t>(status.spoolState)]);
+  if (status.spoolState == SpoolReader::State::open) {
+    object.number("rows", Number{status.spool.rows}).count("bytes", status.spool.bytes);
+    if (status.spool.oldest) object.number("oldest", Number{*status.spool.oldest});
+    if (status.spool.newest) object.number("newest", Number{*status.spool.newest});
+  } else {
+    object.text("reason", std::string_view(status.spoolFailure));
+  }
+  object.end();
+}
+
+std::string statusJson(const Status& status) {
+  std::string out;
+  JsonObject object(out);
+  object.boolean("good", status.good());
+  object.nested("tasking", [&](std::string& inner) {
+    JsonObject(inner)
+        .boolean("tasked", status.tasking.on)
+        .text("source", taskingSourceName(status.tasking.source))
+        .text("file", std::string_view(status.tasking.file))
+        .end();
+  });
+  object.nested("deferral", [&](std::string& inner) {
+    JsonObject deferral(inner);
+    deferral.boolean("wanted", status.deferral.has_value());
+    if (status.deferral) deferral.text("reason", std::string_view(*status.deferral));
+    deferral.end();
+  });
+  object.nested("marker", [&](std::string& inner) {
+    JsonObject marker(inner);
+    marker.boolean("present", status.marker.present);
+    if (status.marker.present) {
+      marker.text("owner", std::string_view(status.marker.owner));
+      addDate(marker, "since", status.marker.since);
+    }
+    marker.end();
+  });
+  if (status.run) {
+    object.nested("last_run",
+                  [&](std::string& inner) { writeRun(inner, *status.run, status.hasBooks()); });
+  }
+  addDate(object, "last_begin", status.lastBegin);
+  object.nested("spool", [&](std::string& inner) { writeSpool(inner, status); });
+  object.nested("journal", [&](std::string& inner) {
+    JsonObject journal(inner);
+    addDate(journal, "oldest", status.journal.oldest);
+    journal.boolean("keeps_a_day", status.keepsADay());
+    if (!status.journal.failure.empty())
+      journal.text("failure", std::string_view(status.journal.failure));
+    journal.end();
+  });
+  object.end();
+  return out + "\n";
+}
+
+// One screen for a human.
+class Screen {
+ public:
+  explicit Screen(const Status& status)
+      : status_(status), terminal_(terminalBehind(STDOUT_FILENO)) {}
+
+  std::string render() {
+    line("Tasking", status_.tasking.on ? "on" : "off",
+         status_.tasking.on ? Colour::good : Colour::caution, status_.taskingWords);
+    line("Deferral", status_.deferral ? "wanted" : "none",
+         status_.deferral ? Colour::caution : Colour::plain,
+         status_.deferral.value_or("nothing speaks against a run now"));
+    lastRun();
+    marker();
+    spool();
+    journal();
+    return out_;
+  }
+
+ private:
+  static constexpr size_t kLabelWidth = 12;
+  static constexpr size_t kAnswerWidth = 13;
+
+  void line(std::string_view label, std::string_view answer, Colour colour,
+            const std::string& words) {
+    std::string left(label);
+    left.resize(kLabelWidth, ' ');
+    std::string middle(answer);
+    middle.resize(std::max(middle.size() + 1, kAnswerWidth), ' ');
+    const size_t indent = kLabelWidth + kAnswerWidth;
+    const std::string right =
+        wrapped(terminalText(words), std::max(terminal_.width, indent + 12) - indent, 0);
+    out_ += left + terminal_.paint(colour, middle);
+    for (const char character : right) {
+      out_ += character;
+      if (character == '\n') out_.append(indent, ' ');
+    }
+    out_.erase(out_.find_last_not_of(' ') + 1);
+    out_ += '\n';
+  }
+  void more(const std::string& words) { line("", "", Colour::plain, words); }
+
+  std::string since(Date date) const {
+    return dateText(date) + " (" + durationText(status_.now - date) + " ago)";
+  }
+
+  void lastRun() {
+    if (!status_.run) {
+      line("Last run", "none", Colour::plain, "no record of a run in the state directory");
+    } else {
+      const RunRecord& run = *status_.run;
+      const bool bad = run.outcome == RunOutcome::failed;
+      const bool well = run.outcome == RunOutcome::completed;
+      line("Last run", runOutcomeName(run.outcome),
+           bad    ? Colour::bad
+           : well ? Colour::good
+                  : Colour::caution,
+           since(run.start) + ", took " + durationText(run.end - run.start));
+      if (!run.failure.empty()) more(run.failure);
+      if (run.outcome == RunOutcome::bailedOut)
+        more("the marker of a run that died stood there; it is removed");
+      if (status_.hasBooks()) books(run);
+    }
+    if (status_.runWithoutRecord()) {
+      more(std::string(status_.run ? "A later run began " : "A run began ") +
+           since(*status_.lastBegin) +
+           " and left no record: it was not tasked, is under way, or died.");
+    }
+  }
+
+  void books(const RunRecord& run) {
+    std::string sums = grouped(run.inspected) + " inspected of " +
+                       counted(run.logEvents, "log event", "log events") + " =";
+    std::string plus = " ";
+    for (const auto verdict : kVerdictOrder) {
+      sums += plus + grouped(run.classified[verdict]) + " " + std::string(verdictName(verdict));
+      plus = " + ";
+    }
+    balance("Objects", run.objectsBalance(), sums);
+    std::string rows = grouped(run.rowsStored) + " rows stored, expected 2 x " +
+                       grouped(run.classified[RunRecord::kReported]) +
+                       (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
+                       " + " + grouped(run.countEvents) + " counts + 1";
+    if (!run.rowsBalance()) rows += " = " + grouped(run.rowsExpected());
+    balance("Rows", run.rowsBalance(), rows);
+    for (const auto& [reason, count] : run.rowsFailed) {
+      if (count != 0) more(grouped(count) + " rows failed: " + reason);
+    }
+    for (const std::string& name : run.setAside) more("a damaged spool was set aside as " + name);
+  }
+  void balance(std::string_view what, bool balances, const std::string& words) {
+    line(what, balances ? "balance" : "DO NOT", balances ? Colour::good : Colour::bad,
+         balances ? words : "balance: " + words);
+  }
+
+  void marker() {
+    if (!status_.marker.present) {
+      line("Marker", "none", Colour::plain, "no run is reporting, and none died");
+      return;
+    }
+    line("Marker", "present", Colour::caution,
+         std::string(cookieFilePath) + " of " + status_.marker.owner + ", since " +
+             since(status_.marker.since) +
+             ": a run is reporting, or died; then the next one only removes it");
+  }
+
+  void spool() {
+    switch (status_.spoolState) {
+      case SpoolReader::State::open:
+        break;
+      case SpoolReader::State::absent:
+        line("Spool", "none", Colour::plain, "nothing was sent");
+        return;
+      case SpoolReader::State::noAccess:
+        line("Spool", "no access", Colour::caution, status_.spoolFailure);
+        return;
+      case SpoolReader::State::damaged:
+        line("Spool", "DAMAGED", Colour::bad, status_.spoolFailure);
+        return;
+    }
+    const SpoolContents& spool = status_.spool;
+    std::string words = grouped((spool.bytes + 1023) / 1024) + " KiB";
+    if (spool.oldest) {
+      words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
+               dateText(Date{std::chrono::microseconds{*spool.newest}});
+    }
+    line("Spool", grouped(static_cast<uint64_t>(spool.rows)) + " rows", Colour::plain, words);
+  }
+
+  void journal() {
+    if (!status_.journal.failure.empty()) {
+      line("Journal", "unreadable", Colour::bad, status_.journal.failure);
+    } else if (!status_.journal.oldest) {
+      line("Journal", "empty", Colour::plain, status_.store);
+    } else {
+      const bool whole = status_.keepsADay();
+      line("Journal", whole ? "whole day" : "part of day", whole ? Colour::good : Colour::caution,
+           status_.store + ": oldest entry " + since(*status_.journal.oldest) +
+               (whole ? "" : "; a run looks back 24 h"));
+    }
+  }
+
+  const Status& status_;
+  const Terminal terminal_;
+  std::string out_;
+};
+
+int runStatus(bool json) {
+  const auto launch = launchConfiguration();
+  if (!launch) return kUsage;
+  if (::access(launch->stateDirectory.c_str(), R_OK | X_OK) != 0 && errno == EACCES) {
+    return failToRead("state directory " + launch->stateDirectory + ": " + errorWords(EACCES),
+                      launch->stateDirectory);
+  }
+  const Status status = gather(*launch);
+  print(json ? statusJson(status) : Screen(status).render());
+  std::fflush(stdout);
+  if (speaksOfPermission(status.journal.failure))
+    return failToRead(status.journal.failure, launch->traceStore);
+  if (status.spoolState == SpoolReader::State::noAccess) return kNoAccess;
+  return status.good() ? kDone : kBad;
+}
+
+}  // namespace
+
+void addStatusCommand(CLI::App& app, Invocation& invocation) {
+  CLI::App* command = app.add_subcommand(
+      "status", "Say whether this machine reports, and whether the books balance");
+  command->footer(
+      "The books of the last run balance where inspected = reported + every reason not to, and "
+      "rows\n"
+      "stored = 2 x reported (1 for an object without a name) + counts + 1. Exit status 1 where "
+      "they\n"
+      "do not, where the last run failed, and where the spool is damaged.\n\n"
+      "Example: warn from a cron job\n"
+      "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root");
+  const auto json = std::make_shared<bool>(false);
+  command->add_flag("--json", *json, "One JSON object");
+  command->callback([&invocation, json] { invocation.status = runStatus(*json); });
+}
+
+}  // namespace tessel::ctl

@@ -1,0 +1,340 @@
+#!/usr/bin/env python3
+"""What tesselctl explains, held against the run's own books and against the rules written down twice."""
+import html.parser
+import json
+import os
+import time
+
+import harness
+from harness import Entry, MachineTest, export_bytes, log_event, point
+from mixed_day import mixed_day
+from model import DISABLED, DOWNSAMPLED, DURATION, KNOWN, REPORTED, WHITELIST, Rules, deliver
+
+VERDICT = {REPORTED: ("reported", 1), DISABLED: ("telemetry_disabled", 0), WHITELIST: ("string_whitelist", 2),
+           DURATION: ("duration", 3), DOWNSAMPLED: ("downsampled", 4)}
+HEADERS = {"Reported tessel object": "reported", "Subsystem/category filtered tessel object": "downsampled",
+           "Duration filtered tessel object": "duration", "String whitelist filtered tessel object": "string_whitelist"}
+
+
+def lines_of(result):
+    return [json.loads(line) for line in result.out.splitlines()]
+
+
+class ExplainTest(MachineTest):
+    def explain(self, *arguments, **extra):
+        result = self.machine.ctl("explain", "--json", *arguments, **extra)
+        self.assertEqual((result.status, result.errors), (0, ""))
+        return lines_of(result)
+
+    def summary(self, *arguments, **extra):
+        return self.explain("--summary", *arguments, **extra)[0]
+
+
+class MixedDay(ExplainTest):
+    def setUp(self):
+        super().setUp()
+        self.entries, _ = mixed_day(self.machine)
+        self.machine.write_export(self.entries)
+
+    def assert_verdicts(self, explained, rules):
+        judged = [(thing, rules.classify(thing)) for thing in deliver(self.entries)]
+        self.assertGreater(len({verdict for _, verdict in judged}), 3)
+        self.assertEqual(
+            [(line["subsystem"], line["category"], line.get("name"), line["kind"], line["verdict"],
+              line["classification"], line["time"]) for line in explained],
+            [(*thing.path, thing.kind, *VERDICT[verdict], thing.end.realtime(self.machine.now))
+             for thing, verdict in judged])
+        return judged
+
+    def test_every_object_gets_the_verdict_of_the_rules(self):
+        self.assert_verdicts(self.explain(), Rules())
+        self.assert_verdicts(self.explain("--internal"), Rules(internal=True))
+
+    def test_the_rule_says_what_decided(self):
+        judged = self.assert_verdicts(self.explain(), Rules())
+        for line, (thing, verdict) in zip(self.explain(), judged):
+            rule = line.get("rule")
+            if verdict == WHITELIST:
+                slot = "STRING1" if thing.get("STRING1_NAME") and thing.get("STRING1_VALUE") not in KNOWN else "STRING2"
+                self.assertEqual((rule["slot"], rule["label"], rule.get("value")),
+                                 (int(slot[-1]), thing.get(slot + "_NAME"), thing.get(slot + "_VALUE")))
+            elif verdict == DURATION:
+                self.assertLess(rule["duration"], 0)
+            elif verdict == DISABLED:
+                self.assertIsNone(rule)
+
+    def test_the_downsampling_counters_are_those_of_the_moment(self):
+        keys = [line for line in self.explain("--subsystem", "com.vantor.TextInput")]
+        self.assertEqual([line["rule"]["seen"] for line in keys], list(range(1, 505)))
+        self.assertEqual([line["rule"]["seen"] for line in keys if line["verdict"] == "reported"], [503])
+        self.assertEqual([line["rule"]["reported"] for line in keys[501:]], [0, 1, 1])
+        for line in keys:
+            self.assertEqual((line["rule"]["scope"], line["rule"]["cap"], line["rule"]["ratio"]),
+                             ("com.vantor.TextInput", 500, 503))
+
+    def test_the_payload_is_the_one_that_the_service_sends(self):
+        explained = [list(line["payload"].items()) for line in self.explain("--payload") if "payload" in line]
+        self.assert_clean(self.machine.run())
+        sent = [payload for name, payload in self.machine.rows() if name == "com.vantor.performance.tessel"]
+        self.assertGreater(len(sent), 10)
+        self.assertEqual(explained, sent)
+
+    def test_the_figures_are_those_of_the_run_pair_by_pair(self):
+        summary = self.summary()
+        run = self.machine.run()
+        self.assert_clean(run)
+        sections, header = {}, None
+        for message in run.log:
+            for line in message.split("\n"):
+                if " count: " in line:
+                    header = HEADERS.get(line.split(" count: ")[0])
+                elif header and ":\t" in line:
+                    pair, count = line.split(":\t")
+                    sections.setdefault(header, {})[pair] = int(count.split(" ")[0])
+        for verdict, counted in sections.items():
+            explained = {f"{pair['subsystem']}/{pair['category']}": pair[verdict] for pair in summary["pairs"]
+                         if pair[verdict]}
+            self.assertEqual(explained, counted, verdict)
+        self.assertEqual(set(sections), set(HEADERS.values()))
+        statistics = dict(self.machine.rows()[-1][1])
+        self.assertEqual(summary["log_events"], statistics["LogObjectsProcessed"])
+        for kind, key in (("Event", "Events"), ("Interval", "Intervals"), ("AnimationInterval", "Animations")):
+            self.assertEqual(summary["kinds"][kind], {"reported": statistics[key + "Reported"],
+                                                      "unreported": statistics[key + "NotReported"]})
+        with open(os.path.join(self.machine.state, "last_run.json"), encoding="utf-8") as file:
+            classified = json.load(file)["classified"]
+        self.assertEqual([summary["verdicts"][name] for name, _ in sorted(VERDICT.values(), key=lambda v: v[1])],
+                         classified[:5])
+
+    def test_the_whitelist_misses_are_the_evidence_for_extending_it(self):
+        expected = {}
+        for line in self.explain("--verdict", "string_whitelist"):
+            key = (line["subsystem"], line["category"], line["name"], line["rule"]["slot"], line["rule"].get("value", ""))
+            expected[key] = expected.get(key, 0) + 1
+        listed = {(miss["subsystem"], miss["category"], miss["name"], miss["slot"], miss["value"]): miss["count"]
+                  for miss in self.summary()["whitelist_misses"]}
+        self.assertGreater(len(expected), 2)
+        self.assertEqual(listed, expected)
+
+    def test_filters_narrow_what_is_shown_and_not_how_it_is_judged(self):
+        everything = self.explain()
+        for arguments, wanted in ((("--subsystem", "com.vantor.M*"), lambda line: line["subsystem"].startswith("com.vantor.M")),
+                                  (("--category", "Keys3"), lambda line: line["category"] == "Keys3"),
+                                  (("--name", "Draw", "--name", "Lost"), lambda line: line.get("name") in ("Draw", "Lost")),
+                                  (("--verdict", "downsampled"), lambda line: line["verdict"] == "downsampled")):
+            chosen = [line for line in everything if wanted(line)]
+            self.assertTrue(chosen and len(chosen) < len(everything))
+            self.assertEqual(self.explain(*arguments), chosen)
+
+    def test_nothing_is_sent_and_nothing_is_left_behind(self):
+        self.explain("--payload")
+        self.assertEqual(os.listdir(self.machine.state), [])
+        self.assertFalse(self.machine.marker_exists())
+
+    def test_compare_tells_what_explain_tells_of_both_sides(self):
+        for a, b, arguments_a, arguments_b in (("usual", "internal", (), ("--internal",)),
+                                               ("Selvin", "Quarro", (), ("--platform", "Quarro"))):
+            result = self.machine.ctl("compare", a, b, "--json")
+            self.assert_clean(result)
+            compared = json.loads(result.out)
+            sides = [self.explain(*arguments) for arguments in (arguments_a, arguments_b)]
+            reported = [[line["verdict"] == "reported" for line in side] for side in sides]
+            starts = sum(not was and is_now for was, is_now in zip(*reported))
+            stops = sum(was and not is_now for was, is_now in zip(*reported))
+            self.assertGreater(starts + stops, 0)
+            self.assertEqual((compared["starts"], compared["stops"]), (starts, stops))
+            listed = {kind: sum(change["count"] for change in compared["changes"] if change["change"] == kind)
+                      for kind in ("start", "stop")}
+            self.assertEqual(listed, {"start": starts, "stop": stops})
+            for side, key in zip(sides, "ab"):
+                self.assertEqual(compared[key]["reported"], sum(line["verdict"] == "reported" for line in side))
+
+    def test_two_periods_are_compared_by_what_is_reported_in_each(self):
+        self.machine.write_export([point("event", "com.vantor.Old", "A", "Gone", at=-90000),
+                                   point("event", "com.vantor.Both", "A", "Stays", at=-90000),
+                                   point("event", "com.vantor.Both", "A", "Stays", at=-50),
+                                   point("event", "com.vantor.Fresh", "A", "Comes", at=-50)], "b.export")
+        result = self.machine.ctl("compare", "since=-26h,until=-24h", "last=2h", "--json")
+        self.assert_clean(result)
+        changes = {change["subsystem"]: (change["change"], change["count"], change["rule"])
+                   for change in json.loads(result.out)["changes"]}
+        self.assertEqual(changes["com.vantor.Old"], ("stop", 1, "not_recorded"))
+        self.assertEqual(changes["com.vantor.Fresh"], ("start", 1, "not_recorded"))
+        self.assertNotIn("com.vantor.Both", changes)
+
+
+class Periods(ExplainTest):
+    def test_a_period_is_what_the_arguments_say(self):
+        hours = [1.5, 5.5, 23.5, 30.5, 50.5]
+        self.machine.write_export([point("event", "com.vantor.A", "B", f"{hour}", at=-3600 * hour)
+                                   for hour in reversed(hours)])
+        stamp = time.strftime("%Y-%m-%dT%H:%M:%SZ", time.gmtime(self.machine.now - 3600 * 24))
+        for arguments, wanted in (((), hours[:3]), (("--last", "2h"), hours[:1]), (("--since", "-2d"), hours[:4]),
+                                  (("--since", "2 days ago", "--until", "5 hours ago"), hours[1:4]),
+                                  (("--until", "-24h", "--last", "1d12h"), hours[3:]),
+                                  (("--since", stamp), hours[:3]), (("--until", stamp), hours[3:4]),
+                                  (("--since", f"@{int(self.machine.now - 7200)}"), hours[:1])):
+            self.assertEqual([line["name"] for line in self.explain(*arguments)],
+                             [f"{hour}" for hour in reversed(hours) if hour in wanted], arguments)
+
+    def test_what_makes_no_sense_is_named_with_its_value(self):
+        self.machine.write_export([log_event("x")])
+        for arguments in (("--since", "soon"), ("--until", "2026-02-30"), ("--last", "24"), ("--last", "-1h"),
+                          ("--since", "25:00"), ("--platform", "quarro"), ("--verdict", "good"),
+                          ("--since", "tomorrow")):
+            result = self.machine.ctl("explain", *arguments)
+            self.assertEqual(result.status, 2, arguments)
+            self.assertIn(arguments[0], result.errors)
+            self.assertIn(f"'{arguments[1]}'", result.errors)
+        self.assertEqual(self.machine.ctl("explain", "--since", "-1h", "--until", "-2h").status, 2)
+
+
+class Follow(ExplainTest):
+    def append(self, entries):
+        with open(os.path.join(self.machine.store, "live.export"), "ab") as file:
+            file.write(export_bytes(entries, time.time(), first_sequence=self.sequence))
+        self.sequence += len(entries)
+
+    def shown(self, process, count):
+        """The first `count` lines, and how long they took to come."""
+        began = time.monotonic()
+        while time.monotonic() - began < 20:
+            process.tessel_output.seek(0)
+            lines = process.tessel_output.read().decode().splitlines()
+            if len(lines) >= count:
+                return [json.loads(line) for line in lines], time.monotonic() - began
+            time.sleep(0.02)
+        self.fail(f"{count} lines did not come: {lines}")
+
+    def test_what_is_recorded_shows_up_once_with_its_reason_and_an_interval_spans_looks(self):
+        self.sequence = 1
+        self.append([point("event", "com.vantor.Old", "A", "Before", at=-30)])
+        process = self.machine.start("tesselctl", "explain", "--follow", "--json")
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+        time.sleep(1.5)
+        self.append([point("event", "com.vantor.Live", "A", "First", string1=("period", "weekly"), at=0)])
+        lines, seconds = self.shown(process, 1)
+        self.assertEqual((lines[0]["name"], lines[0]["verdict"], lines[0]["rule"]["value"]),
+                         ("First", "string_whitelist", "weekly"))
+        self.assertLess(seconds, 5 if harness.SANITIZED else 2)
+        self.append([point("begin", "com.vantor.Live", "A", "Span", at=0)])
+        time.sleep(1)
+        self.append([point("end", "com.vantor.Live", "A", "Span", at=0),
+                     point("event", "com.vantor.Live", "A", "Twin", at=0)])
+        lines, _ = self.shown(process, 3)
+        time.sleep(1.2)
+        lines, _ = self.shown(process, 3)
+        self.assertEqual([(line["name"], line["kind"]) for line in lines],
+                         [("First", "Event"), ("Span", "Interval"), ("Twin", "Event")])
+
+
+class PageReader(html.parser.HTMLParser):
+    """The tags, the texts and the tables of a page."""
+
+    def __init__(self, page):
+        super().__init__(convert_charrefs=True)
+        self.tags, self.attributes, self.tables, self.text = set(), [], {}, []
+        self.table, self.row = None, None
+        self.feed(page)
+
+    def handle_starttag(self, tag, attrs):
+        attributes = dict(attrs)
+        self.tags.add(tag)
+        self.attributes += list(attributes)
+        if tag == "table":
+            self.table = self.tables.setdefault(attributes["id"], [])
+        elif tag == "tr" and self.table is not None:
+            self.row = []
+            self.table.append(self.row)
+        elif tag in ("td", "th") and self.row is not None:
+            self.row.append("")
+        elif tag == "data" and self.row:
+            self.row[-1] = int(attributes["value"])
+
+    def handle_data(self, data):
+        self.text.append(data)
+        if self.row and isinstance(self.row[-1], str):
+            self.row[-1] += data
+
+
+class Report(ExplainTest):
+    MARKUP = ["<script>alert(1)</script>", "\"><img src=x onerror=alert(1)>", "</style><b>", "&lt;b&gt;", "'--><svg/onload=x>"]
+
+    def page(self, *arguments):
+        path = os.path.join(self.machine.root, "page.html")
+        self.assert_clean(self.machine.ctl("report", "--html", path, *arguments))
+        with open(path, encoding="utf-8", newline="") as file:
+            return file.read()
+
+    def test_its_figures_are_those_of_explain(self):
+        entries, _ = mixed_day(self.machine)
+        self.machine.write_export(entries)
+        self.assert_clean(self.machine.run())
+        summary = self.summary()
+        for arguments in ((), ("--last-run",)):
+            page = PageReader(self.page(*arguments))
+            verdicts = {row[0]: row[1] for row in page.tables["verdicts"][1:]}
+            self.assertEqual([verdicts[title] for title in (
+                "Reported", "Not marked for telemetry", "A text value is not a known one", "Negative duration",
+                "Held back by downsampling", "Kind cannot be reported")],
+                [summary["verdicts"][name] for name in ("reported", "telemetry_disabled", "string_whitelist", "duration",
+                                                        "downsampled", "class_not_supported")])
+            self.assertEqual({row[0]: row[1:3] for row in page.tables["pairs"][1:]},
+                             {f"{pair['subsystem']} / {pair['category']}":
+                              [sum(pair[name] for name, _ in VERDICT.values()), pair["reported"]]
+                              for pair in summary["pairs"][:40]})
+            self.assertEqual(sum(sum(row[1:]) for row in page.tables["slices"][1:]), summary["trace_objects"])
+            self.assertEqual(sum(row[0] for row in page.tables["misses"][1:]), summary["verdicts"]["string_whitelist"])
+            self.assertEqual({row[0]: {"reported": row[1], "unreported": row[2]} for row in page.tables["kinds"][1:]},
+                             summary["kinds"])
+
+    def test_no_recorded_string_becomes_markup(self):
+        texts = self.MARKUP + ["\x1b[31mred", "\u202eright", "line\nfeed", "\x00", "caf\udce9"]
+        self.machine.write_export([point("event", "com.vantor." + text, text, text, string1=(text, text), at=-60 - i)
+                                   for i, text in enumerate(reversed(texts))])
+        page = self.page()
+        read = PageReader(page)
+        self.assertEqual(len(read.tables["pairs"]) - 1, len(texts))
+        self.assertLessEqual(read.tags, set("""html head meta title style body header h1 p main div b data section h2 svg
+                                               rect g path table tr th td span ul li details summary code footer""".split()))
+        self.assertFalse([name for name in read.attributes if name.startswith("on") or name in ("src", "href")])
+        for text in self.MARKUP:
+            self.assertIn(text, "".join(read.text))
+        for forbidden in ("\x1b", "\u202e", "\x00", "<script", "<img", "<b>alert", "http://", "https://"):
+            self.assertNotIn(forbidden, page)
+
+    def test_an_empty_period_is_a_page_too(self):
+        self.machine.write_export([log_event("nothing else")])
+        page = PageReader(self.page())
+        self.assertEqual(page.tables["verdicts"][1][1], 0)
+
+
+class Reading(ExplainTest):
+    def test_what_came_of_no_object_is_counted_under_its_reason(self):
+        self.machine.write_export([
+            log_event("plain"), point("evnt", "a", "b"), Entry([("TESSEL_KIND", "event"), ("TESSEL_SUBSYSTEM", "a")]),
+            point("event", "a", "b", duration="long"), point("end", "a", "b"), point("begin", "a", "b", "open")])
+        summary = self.summary()
+        self.assertEqual((summary["log_events"], summary["trace_objects"]), (6, 0))
+        self.assertEqual(sum(summary["malformed"].values()), 3)
+        self.assertEqual((summary["intervals"]["unmatched_ends"], summary["intervals"]["open"]), (1, 1))
+        self.assertEqual([(os.path.basename(file["path"]), file["entries_read"]) for file in summary["files"]],
+                         [("a.export", 6)])
+
+    def test_a_damaged_file_is_named_and_the_rest_is_read(self):
+        self.machine.write_export([point("event", "com.vantor.A", "B", "C")])
+        with open(os.path.join(self.machine.store, "b.export"), "wb") as file:
+            file.write(b"no equals sign\n\n" + export_bytes([point("event", "com.vantor.D", "E", "F", at=-50)], self.machine.now,
+                                                            first_sequence=7))
+        with open(os.path.join(self.machine.store, "c.journal"), "wb") as file:
+            file.write(b"LPKSHHRH" + b"\xff" * 4096)
+        summary = self.summary()
+        self.assertEqual(summary["trace_objects"], 2)
+        files = {os.path.basename(file["path"]): file for file in summary["files"]}
+        self.assertTrue(files["b.export"]["problems"])
+        self.assertIn("skipped", files["c.journal"])
+
+
+if __name__ == "__main__":
+    harness.main()

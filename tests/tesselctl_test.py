@@ -1,0 +1,331 @@
+#!/usr/bin/env python3
+"""tesselctl as people and scripts meet it: exit statuses, terminals, hostile texts, the spool, the switches."""
+import contextlib
+import errno
+import json
+import os
+import pty
+import re
+import sqlite3
+import subprocess
+import time
+
+import harness
+from harness import BIN, TASKING, MachineTest, log_event, point
+
+HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "two\nlines", "tab\tand\rreturn",
+           "\x7fdelete", "caf\udce9", "\u2028separator"]
+# What no text of the outside may bring to a terminal, line feeds apart.
+OBEYED = re.compile("[\x00-\x09\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028\u2029\u202a-\u202e\u2066-\u2069\udc80-\udcff]")
+COLOUR = re.compile("\x1b\\[[0-9]{1,2}m")
+
+
+def hostile_points():
+    return [point("event", "com.vantor." + text, text, text, string1=(text, text), number1=(text, 1), at=-60 - i)
+            for i, text in enumerate(HOSTILE)] + [point("event", "com.vantor.Fine", text, text) for text in HOSTILE]
+
+
+class CtlTest(MachineTest):
+    def spool(self):
+        return os.path.join(self.machine.state, "statora.db")
+
+    def on_terminal(self, *arguments, columns=80, **extra):
+        """What the command writes to a terminal of so many columns, and its exit status."""
+        leader, follower = pty.openpty()
+        environment = self.machine.environment(**{"TERM": "xterm", **extra})
+        script = f"stty cols {columns}; exec " + '"$0" "$@"'
+        process = subprocess.Popen(["sh", "-c", script, os.path.join(BIN, "tesselctl"), *arguments], env=environment,
+                                   stdin=follower, stdout=follower, stderr=subprocess.PIPE)
+        os.close(follower)
+        out = b""
+        while True:
+            try:
+                part = os.read(leader, 65536)
+            except OSError as error:
+                if error.errno != errno.EIO:
+                    raise
+                break
+            if not part:
+                break
+            out += part
+        os.close(leader)
+        process.communicate()
+        return process.returncode, out.decode("utf-8", "surrogateescape").replace("\r\n", "\n")
+
+    def as_nobody(self, *arguments):
+        return subprocess.run([os.path.join(BIN, "tesselctl"), *arguments], env=self.machine.environment(),
+                              capture_output=True, text=True, user=65534, group=65534, extra_groups=[], check=False)
+
+
+class Statuses(CtlTest):
+    def test_each_outcome_has_its_status_and_names_what_it_is_about(self):
+        for arguments, status, said in (
+                ((), 2, "subcommand"), (("nope",), 2, "'nope'"), (("explain", "--nope"), 2, "--nope"),
+                (("explain", "--store", "/nowhere"), 1, "/nowhere"), (("events",), 1, self.spool()),
+                (("report",), 2, "--html"), (("report", "--html", "/nowhere/x"), 1, "/nowhere/x"),
+                (("report", "--html", "-", "--last-run"), 1, self.machine.state),
+                (("compare", "usual", "unusual"), 2, "unusual"), (("defer",), 2, "subcommand"),
+                (("explain", "--follow", "--summary"), 2, "--follow"), (("events", "--since", "soon"), 2, "'soon'")):
+            if arguments[:1] != ("explain",) or "--store" not in arguments:
+                self.machine.write_export([log_event("x")])
+            result = self.machine.ctl(*arguments)
+            self.assertEqual(result.status, status, (arguments, result.errors))
+            self.assertIn(said, result.errors + result.out)
+
+    def test_a_launch_variable_that_makes_no_sense_is_usage(self):
+        result = self.machine.ctl("status", TESSEL_DEFER_RETRY="soon")
+        self.assertEqual(result.status, 2)
+        self.assertIn("TESSEL_DEFER_RETRY", result.errors)
+
+    def test_every_command_explains_itself_within_80_columns_and_with_an_example(self):
+        for command in ("explain", "compare", "events", "status", "defer", "tasking", "report"):
+            result = self.machine.ctl(command, "--help")
+            self.assertEqual(result.status, 0)
+            self.assertIn("Example", result.out)
+            self.assertIn("tesselctl " + command, result.out)
+            for line in result.out.splitlines():
+                self.assertLessEqual(len(line), 95, line)
+
+    def test_without_access_the_hint_says_what_to_do(self):
+        if os.geteuid() != 0:
+            self.skipTest("needs root to become somebody else")
+        self.machine.write_export([log_event("x")])
+        os.chmod(self.machine.root, 0o755)
+        for folder in (self.machine.store, self.machine.state):
+            os.chmod(folder, 0o700)
+        os.chmod(self.machine.config, 0o755)
+        for arguments in (("explain",), ("events",), ("status",), ("defer", "on"), ("tasking", "on"),
+                          ("report", "--html", os.path.join(self.machine.config, "page.html"))):
+            result = self.as_nobody(*arguments)
+            self.assertEqual(result.returncode, 4, (arguments, result.stderr))
+            self.assertIn("ermission denied", result.stderr)
+            self.assertRegex(result.stderr, "Run tesselctl as|Join the group")
+
+
+class Terminals(CtlTest):
+    def setUp(self):
+        super().setUp()
+        self.machine.write_export(hostile_points())
+        self.assert_clean(self.machine.run())
+        self.machine.now = time.time()
+
+    COMMANDS = [("explain",), ("explain", "--payload"), ("explain", "--json", "--payload"), ("explain", "--summary"),
+                ("explain", "--summary", "--json"), ("events",), ("events", "--json"), ("status",), ("status", "--json"),
+                ("compare", "usual", "internal"), ("compare", "usual", "internal", "--json"), ("report", "--html", "-")]
+
+    def test_nothing_that_a_terminal_obeys_comes_out(self):
+        with contextlib.closing(sqlite3.connect(self.spool())) as database, database:
+            for text in HOSTILE:
+                text = text.encode("utf-8", "surrogateescape").decode("latin-1")
+                database.execute("INSERT INTO events(time, name, payload) VALUES(?, ?, ?)",
+                                 (int(time.time() * 1e6), text, json.dumps({text: text}, ensure_ascii=False)))
+                database.execute("INSERT INTO events(time, name, payload) VALUES(1, 'bare', ?)", (text,))
+        for arguments in self.COMMANDS:
+            result = self.machine.ctl(*arguments)
+            self.assertEqual(result.status, 0, result.errors)
+            found = OBEYED.search(result.out)
+            self.assertIsNone(found, (arguments, found and result.out[max(0, found.start() - 60):found.end() + 20]))
+            if "--json" in arguments:
+                for line in result.out.splitlines():
+                    json.loads(line)
+        for text in ("\x1b[31mx", "\u009b"):
+            result = self.machine.ctl("explain", "--store", "/nowhere/" + text, "--since", text)
+            self.assertIsNone(OBEYED.search(result.errors), result.errors)
+
+    def test_colours_are_for_terminals_that_want_them(self):
+        for arguments in (("explain",), ("explain", "--summary"), ("status",), ("events",)):
+            status, coloured = self.on_terminal(*arguments)
+            self.assertEqual(status, 0)
+            self.assertRegex(coloured, COLOUR)
+            plain = COLOUR.sub("", coloured)
+            self.assertNotIn("\x1b", plain)
+            for refused in (dict(NO_COLOR="1"), dict(TERM="dumb")):
+                self.assertNotIn("\x1b", self.on_terminal(*arguments, **refused)[1])
+            self.assertNotIn("\x1b", self.machine.ctl(*arguments).out)
+
+    def test_lines_fit_80_columns_and_the_terminal(self):
+        for columns in (80, 60):
+            for arguments in (("explain",), ("explain", "--summary"), ("status",), ("events",),
+                              ("compare", "usual", "internal")):
+                _, out = self.on_terminal(*arguments, columns=columns, NO_COLOR="1")
+                for line in out.splitlines():
+                    self.assertLessEqual(len(line), columns, (arguments, line))
+        for line in self.machine.ctl("explain").out.splitlines():
+            self.assertLessEqual(len(line), 80)
+
+
+class Events(CtlTest):
+    def setUp(self):
+        super().setUp()
+        self.machine.write_export([point("event", "com.vantor.A", "x", "One", number1=("n", "0.1")),
+                                   point("event", "com.vantor.B", "y", "Two")])
+        self.assert_clean(self.machine.run())
+
+    def events(self, *arguments):
+        result = self.machine.ctl("events", "--json", *arguments)
+        self.assertEqual((result.status, result.errors), (0, ""))
+        return [json.loads(line, object_pairs_hook=list) for line in result.out.splitlines()]
+
+    def test_they_are_the_rows_in_order(self):
+        rows = self.machine.rows()
+        self.assertGreater(len(rows), 5)
+        shown = [dict(event) for event in self.events()]
+        self.assertEqual([(event["name"], event["payload"]) for event in shown], rows)
+        self.assertEqual([event["id"] for event in shown], list(range(1, len(rows) + 1)))
+        self.assertEqual(len(self.machine.ctl("events").out.splitlines()), len(rows))
+
+    def test_filters(self):
+        names = lambda *arguments: [dict(event)["name"] for event in self.events(*arguments)]
+        rows = [name for name, _ in self.machine.rows()]
+        self.assertEqual(names("--name", "ts__*"), ["ts__com.vantor.A__x__One", "ts__com.vantor.B__y__Two"])
+        self.assertEqual(names("--subsystem", "com.vantor.B", "--name", "*.tessel"), ["com.vantor.performance.tessel"])
+        self.assertEqual(names("--category", "x", "--name", "ts__*"), ["ts__com.vantor.A__x__One"])
+        self.assertEqual(names("-n", "2"), rows[-2:])
+        self.assertEqual(names("--last", "1h"), rows)
+        self.assertEqual(names("--until", "-1h"), [])
+
+    def test_it_follows_the_spool_and_a_new_one_in_its_place(self):
+        process = self.machine.start("tesselctl", "events", "--follow", "--json", "-n", "1")
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+
+        def wait_for_name(name):
+            for _ in range(500):
+                process.tessel_output.seek(0)
+                if f'"name":"{name}"'.encode() in process.tessel_output.read():
+                    return
+                time.sleep(0.02)
+            self.fail(f"{name} did not show up")
+
+        wait_for_name("com.vantor.performance.tessel_reporting_stats")
+        with contextlib.closing(sqlite3.connect(self.spool())) as database, database:
+            database.execute("INSERT INTO events(time, name, payload) VALUES(1, 'added', '{}')")
+        wait_for_name("added")
+        os.rename(self.spool(), self.spool() + ".aside")
+        with contextlib.closing(sqlite3.connect(self.spool() + ".new")) as database, database:
+            database.execute("CREATE TABLE events(id INTEGER PRIMARY KEY AUTOINCREMENT, time INTEGER NOT NULL,"
+                             " name TEXT NOT NULL, payload TEXT NOT NULL)")
+            database.execute("INSERT INTO events(time, name, payload) VALUES(1, 'of the new spool', '{}')")
+        os.rename(self.spool() + ".new", self.spool())
+        wait_for_name("of the new spool")
+
+    def test_a_reader_who_may_only_read_sees_them(self):
+        if os.geteuid() != 0:
+            self.skipTest("needs root to become somebody else")
+        for path, mode in ((self.machine.root, 0o755), (self.machine.state, 0o755), (self.spool(), 0o644)):
+            os.chmod(path, mode)
+        result = self.as_nobody("events")
+        self.assertEqual((result.returncode, len(result.stdout.splitlines())), (0, len(self.machine.rows())), result.stderr)
+        self.assertEqual([name for name in os.listdir(self.machine.state) if name.startswith("statora.db-")], [])
+
+    def test_a_damaged_spool_is_called_that(self):
+        with open(self.spool(), "r+b") as file:
+            file.write(os.urandom(4096))
+        for command in ("events", "status"):
+            result = self.machine.ctl(command)
+            self.assertEqual(result.status, 1)
+            self.assertIn("damaged", (result.out + result.errors).lower())
+
+
+class Status(CtlTest):
+    def status(self, **extra):
+        result = self.machine.ctl("status", "--json", **extra)
+        self.assertEqual(result.errors, "")
+        return result.status, json.loads(result.out)
+
+    def record(self):
+        return os.path.join(self.machine.state, "last_run.json")
+
+    def change_record(self, **changes):
+        with open(self.record(), encoding="utf-8") as file:
+            record = json.load(file)
+        record.update(changes)
+        with open(self.record(), "w", encoding="utf-8") as file:
+            json.dump(record, file)
+
+    def run_once(self):
+        self.machine.write_export([point("event", "com.vantor.A", "x", "One"), point("event", "com.vantor.A", "x", None),
+                                   point("event", "com.vantor.A", "x", "Two", telemetry=False)])
+        self.assert_clean(self.machine.run())
+
+    def test_a_machine_that_never_ran_is_said_to_be_that(self):
+        self.machine.write_export([log_event("x")])
+        exit_status, status = self.status()
+        self.assertEqual(exit_status, 0)
+        self.assertNotIn("last_run", status)
+        self.assertEqual(status["spool"]["state"], "absent")
+        self.assertEqual(os.listdir(self.machine.state), [])
+
+    def test_the_books_of_a_run_balance_and_cooked_ones_do_not(self):
+        self.run_once()
+        exit_status, status = self.status()
+        run = status["last_run"]
+        self.assertEqual((exit_status, status["good"], run["objects_balance"], run["rows_balance"]), (0, True, True, True))
+        self.assertEqual((run["inspected"], run["reported"], run["telemetry_disabled"], run["unnamed"]), (3, 2, 1, 1))
+        self.assertEqual(run["rows_stored"], len(self.machine.rows()))
+        self.assertEqual(status["spool"]["rows"], len(self.machine.rows()))
+        for changes in (dict(rows_stored=run["rows_stored"] - 1), dict(inspected=4), dict(outcome="failed")):
+            self.run_once()
+            self.change_record(**changes)
+            exit_status, status = self.status()
+            self.assertEqual((exit_status, status["good"]), (1, False), changes)
+            self.assertEqual(self.machine.ctl("status").status, 1)
+
+    def test_it_says_what_the_next_run_will_meet(self):
+        self.machine.write_export([log_event("old", at=-90000), log_event("new")])
+        self.assertEqual(self.status()[1]["deferral"], {"wanted": False})
+        self.assertFalse(self.status()[1]["marker"]["present"])
+        self.assertTrue(self.status()[1]["journal"]["keeps_a_day"])
+        self.assertEqual(self.machine.ctl("defer", "on").status, 0)
+        open(os.path.join(self.machine.var_tmp, harness.MARKER), "w", encoding="utf-8").close()
+        self.machine.write_export([log_event("new")])
+        status = self.status()[1]
+        self.assertTrue(status["deferral"]["wanted"])
+        self.assertIn("/defer", status["deferral"]["reason"])
+        self.assertTrue(status["marker"]["present"])
+        self.assertFalse(status["journal"]["keeps_a_day"])
+
+
+class Switches(CtlTest):
+    def tasking_file(self):
+        return os.path.join(self.machine.config, TASKING)
+
+    def shown(self):
+        return json.loads(self.machine.ctl("tasking", "show", "--json").out)
+
+    def test_tasking_is_what_the_service_will_find(self):
+        self.machine.write_export([point("event", "com.vantor.A", "x", "One")])
+        for argument, rows in (("off", 0), ("on", 6)):
+            self.assertEqual(self.machine.ctl("tasking", argument).status, 0)
+            self.assertEqual((self.shown()["tasked"], self.shown()["source"]), (argument == "on", "configuration"))
+            self.assert_clean(self.machine.run())
+            self.assertEqual(len(self.machine.rows()), rows)
+        self.assertEqual(os.stat(self.tasking_file()).st_mode & 0o777, 0o644)
+        self.assertEqual(os.listdir(self.machine.config), [TASKING])
+
+    def test_it_shows_where_the_answer_comes_from(self):
+        for text, tasked, source in (('{"TaskedOn": 1}', True, "configuration"), ('{"TaskedOn": 0.0}', False, "configuration"),
+                                     ('{"TaskedOn": "yes"}', False, "unusable"), ("{", False, "unusable"),
+                                     ("[]", False, "unusable"), ("{}", False, "unusable")):
+            self.machine.task(text)
+            self.assertEqual((self.shown()["tasked"], self.shown()["source"]), (tasked, source), text)
+        os.unlink(self.tasking_file())
+        self.assertEqual((self.shown()["tasked"], self.shown()["source"]), (False, "absent"))
+        self.machine.set_internal(True)
+        self.assertEqual((self.shown()["tasked"], self.shown()["source"]), (True, "internal_build"))
+
+    def test_other_keys_of_the_configuration_stay(self):
+        self.machine.task('{"Other": [1, 2.50], "TaskedOn": false}')
+        self.assertEqual(self.machine.ctl("tasking", "on").status, 0)
+        with open(self.tasking_file(), encoding="utf-8") as file:
+            self.assertEqual(json.load(file), {"Other": [1, 2.5], "TaskedOn": True})
+
+    def test_deferral_is_switched_once(self):
+        for argument, present, changed in (("on", True, True), ("on", True, False), ("off", False, True), ("off", False, False)):
+            result = json.loads(self.machine.ctl("defer", argument, "--json").out)
+            self.assertEqual((result["defer"], result["changed"]), (present, changed))
+            self.assertEqual(os.path.exists(os.path.join(self.machine.state, "defer")), present)
+
+
+if __name__ == "__main__":
+    harness.main()
