@@ -163,6 +163,25 @@ class TwoProcesses(MachineTest):
         self.assert_clean(self.machine.result(process))
 
 
+class TwoRuns(MachineTest):
+    def test_what_a_process_keeps_from_run_to_run(self):
+        thinned = [point("event", "com.vantor.TextInput", "Key", "Press", string1=("period", "week"), at=-300 + i * 0.01)
+                   for i in range(300)]
+        self.machine.write_journal(some_points(10) + thinned)
+        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1")
+        wait_for(lambda: [name for name, _ in self.machine.rows()].count(STATISTICS) >= 2)
+        interrupt(process)
+        result = self.machine.result(process)
+        self.assert_clean(result)
+        books = [dict(payload) for name, payload in self.machine.rows() if name == STATISTICS]
+        self.assertEqual([book["EventsReported"] for book in books[:2]], [10, 11], "the 503rd object is in the second")
+        throttled = [int(line.split()[1]) for line in result.log if line.startswith("Throttled ")]
+        self.assertEqual(sorted(set(throttled)), throttled, "the totals of the process")
+        for once in ("Checking in", "Using string whitelist with 327 elements for Selvin platform",
+                     "125000.000000 us, 125000000.000000 mach time units per quantum of 10 reported events"):
+            self.assertEqual(result.log.count(once), 1, once)
+
+
 class Interrupt(MachineTest):
     def test_it_ends_with_0_at_once_whatever_is_going_on(self):
         self.machine.write_journal(some_points(400))
