@@ -83,6 +83,25 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
   }
 }
 
+void addStore(RunRecord& record, const ExtractionReport& found) {
+  uint64_t malformed = 0;
+  for (const uint64_t count : found.assembly.malformed) malformed += count;
+  uint64_t skipped = 0;
+  uint64_t damaged = 0;
+  for (const FileReport& file : found.store.files) {
+    skipped += file.skipped ? 1 : 0;
+    damaged += file.problems.empty() ? 0 : 1;
+  }
+  record.logEvents = found.entriesRead;
+  record.store = {{"files", found.store.files.size()},
+                  {"files_skipped", skipped},
+                  {"files_damaged", damaged},
+                  {"entries_missing", found.store.missingEntries},
+                  {"malformed", malformed},
+                  {"open_intervals_dropped", found.assembly.droppedOpenIntervals},
+                  {"beyond_pair_limit", found.beyondPairLimit}};
+}
+
 RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
   RunRecord record;
   record.start = report.began;
@@ -93,7 +112,10 @@ RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
   record.unnamed = report.unnamed;
   record.countEvents = report.countEvents;
   if (report.filter) addObjects(record, *report.filter);
-  if (report.extractor) record.logEvents = report.extractor->processedEventCount();
+  // The run's extractor is the one that makeRun() hands out.
+  if (report.extractor)
+    addStore(record, static_cast<const JournalExtractor&>(*report.extractor).report());
+  record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
   addRows(record, figures);
   return record;
 }
@@ -122,8 +144,12 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   return keep<ReportingRun>(
       gate, cookie, RunSurroundings{status, queues, clock, keep<MountTable>(), variant},
-      [store = launch.traceStore] { return std::make_shared<JournalExtractor>(store); }, road,
-      summary,
+      [store = launch.traceStore, &status] {
+        auto extractor = std::make_shared<JournalExtractor>(store);
+        extractor->reportProgressTo(status);
+        return extractor;
+      },
+      road, summary,
       [&spool, &state, &reportingQueue](const RunReport& report) {
         reportingQueue.sync([&] { keepRecord(report, spool, state.path()); });
       });

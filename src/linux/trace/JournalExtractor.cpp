@@ -9,6 +9,8 @@ namespace tessel {
 
 namespace {
 
+constexpr uint64_t kEntriesPerStep = 4096;
+
 // Dates before 1970 are before every entry.
 uint64_t microsecondsSince1970(Date date) {
   return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
@@ -64,7 +66,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
 
 void JournalExtractor::processEntries(EntryStream& entries) {
   while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
-    ++report_.entriesRead;
+    if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
     const Entry entry = entries.entry();
     current_ = entry.header;
     assembler_.consume(entry);

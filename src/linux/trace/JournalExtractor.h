@@ -18,6 +18,7 @@
 #include "linux/trace/PairLimit.h"
 #include "linux/trace/TracePointTable.h"
 #include "objects/TesselSupportObjectExtractor.h"
+#include "platform/ServiceStatus.h"
 
 namespace tessel {
 
@@ -32,6 +33,8 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   // `systemStore` is where the system's own trace store is; absent, it is the machine's journal.
   explicit JournalExtractor(std::optional<std::string> systemStore = std::nullopt,
                             const ExtractionLimits& limits = {});
+  // Tells `status`, which must outlive the extractor, every few thousand entries that it gets on.
+  void reportProgressTo(ServiceStatus& status) { status_ = &status; }
 
   void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;
   void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
@@ -75,6 +78,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   AnimationIntervalCallback animationInterval_;
   EventCallback event_;
   bool buildCompositeTimelines_ = false;
+  ServiceStatus* status_ = nullptr;
 
   EntryHeader current_;
   ExtractionReport report_;
