@@ -6,6 +6,7 @@
 
 #include "linux/trace/EntryMerger.h"
 #include "linux/trace/ExportEntryStream.h"
+#include "linux/trace/ForeignJournalStream.h"
 #include "linux/trace/JournalEntryStream.h"
 #include "linux/trace/LossTokenizer.h"
 #include "linux/trace/StoreFiles.h"
@@ -148,8 +149,11 @@ std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uin
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
-    report.skipped = "written with features that are not known";
-    return nullptr;
+    auto foreign =
+        ForeignJournalStream::start(file.path, header.entryCount, tokenizer, stop, report);
+    if (!foreign) report.skipped = "written with features that are not known";
+    usableFiles += foreign != nullptr;
+    return foreign;
   }
   ++usableFiles;
   if (header.headRealtime != 0) seeTime(header.headRealtime);

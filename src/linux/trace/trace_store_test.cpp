@@ -10,6 +10,7 @@
 #include <filesystem>
 
 #include "linux/testing/TemporaryDirectory.h"
+#include "linux/trace/ForeignJournalStream.h"
 #include "linux/trace/JournalFormat.h"
 #include "linux/trace/testing/JournalOracle.h"
 #include "linux/trace/testing/JournalWriter.h"
@@ -213,6 +214,33 @@ TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {
   EXPECT_EQ(reading.entries.size(), 10u);
   EXPECT_EQ(reading.report.files.at(0).skipped, "not a journal file");
   EXPECT_EQ(reading.report.files.at(1).skipped, "it is empty");
+}
+
+// journalctl does not know the flag either, which is as near as a test comes to a newer one.
+TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
+  const TemporaryDirectory directory;
+  std::string file = someJournal(10);
+  file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
+  directory.write("foreign.journal", file);
+  directory.write("known.journal", someJournal(10));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  ASSERT_FALSE(reading.report.files.at(0).problems.empty());
+  const FileProblem& last = reading.report.files.at(0).problems.back();
+  EXPECT_EQ(last.reason, "entries that journalctl did not read");
+  EXPECT_EQ(last.count, 10u);
+}
+
+TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
+  const TemporaryDirectory directory;
+  const std::string path = directory.write("a.journal", someJournal(100));
+  testing::RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  FileReport report;
+  const auto stream = ForeignJournalStream::start(path, 100, tokenizer, stop, report);
+  ASSERT_NE(stream, nullptr);
+  EXPECT_EQ(testing::readAll(*stream, tokenizer).size(), 100u);
+  EXPECT_TRUE(report.problems.empty());
 }
 
 TEST(TraceStoreTest, ReadsAFileOfSeveralNamesOnce) {
