@@ -1,0 +1,128 @@
+"""A machine on which things go wrong, by a preloaded library or from outside, and what must hold then."""
+import contextlib
+import json
+import os
+import shutil
+import sqlite3
+import sys
+import threading
+
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+
+from harness import BIN, Machine, point  # noqa: E402
+
+SHIM = os.path.join(BIN, "fault_shim.so")
+STATISTICS = "com.vantor.performance.tessel_reporting_stats"
+BAILED = "Bailing due to cookie file"
+# Each step of a run by a line that the log has for it, and whether the run marker is there then.
+STEPS = [("Checking in", False), ("Reporting based on being tasked-on", False), ("Created cookie file", True),
+         ("Filesystem for", True), ("Boot disk type", True), ("mach time units per quantum", True),
+         ("Sleeping for", True), ("Total tessel object count", True), ("(Count reported to Statora)", True),
+         ("String whitelist filtered tessel object count", True), ("Done processing", True), ("Throttled", True),
+         ("Cleared cookie file", False)]
+
+
+def some_points(count):
+    return [point("event", "com.vantor.Calendar", "View", f"Open{i}", at=-600 + i * 0.01) for i in range(count)]
+
+
+def stable(rows):
+    """Rows without what differs from run to run."""
+    return [(name, [pair for pair in payload if pair[0] != "ProcessingDurationInSeconds"]) for name, payload in rows]
+
+
+def is_subsequence(part, whole):
+    rest = iter(whole)
+    return all(row in rest for row in part)
+
+
+class FaultMachine(Machine):
+    def __init__(self, points):
+        super().__init__()
+        self.task()
+        self.durable = os.path.join(self.root, "durable")
+        self.expected = self.rows_of_a_good_run(points)
+
+    def rows_of_a_good_run(self, points):
+        self.write_export(points)
+        result = self.run()
+        assert result.status == 0, result.errors
+        rows = stable(self.rows())
+        self.forget_state()
+        return rows
+
+    def forget_state(self):
+        for folder in (self.state, self.var_tmp, self.durable):
+            shutil.rmtree(folder, ignore_errors=True)
+            os.mkdir(folder)
+
+    def faults(self, **faults):
+        """The environment that makes the faults; keywords are the library's variables without FAULT_."""
+        options = "verify_asan_link_order=0:handle_segv=1"
+        return {"LD_PRELOAD": SHIM, "ASAN_OPTIONS": options,
+                **{"FAULT_" + key: str(value) for key, value in faults.items()}}
+
+    def run_faulty(self, **faults):
+        return self.run(**self.faults(**faults))
+
+    def count_calls(self, **faults):
+        """How many calls a good run makes that the faults would be about."""
+        count = os.path.join(self.root, "count")
+        self.run_faulty(COUNT=count, **faults)
+        self.forget_state()
+        with open(count, encoding="ascii") as file:
+            return int(file.read())
+
+    def record(self):
+        try:
+            with open(os.path.join(self.state, "last_run.json"), encoding="utf-8") as file:
+                return json.load(file)
+        except FileNotFoundError:
+            return None
+
+    def ids(self):
+        path = os.path.join(self.state, "statora.db")
+        if not os.path.exists(path):
+            return []
+        with contextlib.closing(sqlite3.connect(path)) as database:
+            check = database.execute("PRAGMA integrity_check").fetchall()
+            assert check == [("ok",)], check
+            if not database.execute("SELECT 1 FROM sqlite_master WHERE name = 'events'").fetchall():
+                return []
+            return [row[0] for row in database.execute("SELECT id FROM events ORDER BY id")]
+
+    def stored(self):
+        """The rows, after a look at the database's health."""
+        ids = self.ids()
+        rows = stable(self.rows())
+        assert ids == list(range(1, len(ids) + 1)), "a row is missing in the middle"
+        return rows
+
+    def use_what_a_power_cut_leaves(self):
+        """Puts in place of the spool what had been flushed of it when the process was killed."""
+        for suffix in ("", "-wal", "-shm"):
+            with contextlib.suppress(FileNotFoundError):
+                os.unlink(os.path.join(self.state, "statora.db" + suffix))
+        for name in os.listdir(self.durable):
+            if name.startswith("statora.db"):
+                shutil.copy(os.path.join(self.durable, name), self.state)
+
+
+class Watcher(threading.Thread):
+    """Follows how many rows another client of the spool has seen committed."""
+
+    def __init__(self, machine):
+        super().__init__()
+        self.path, self.seen, self.ended = os.path.join(machine.state, "statora.db"), 0, threading.Event()
+
+    def run(self):
+        while not self.ended.wait(0.005):
+            with contextlib.suppress(sqlite3.Error):
+                if os.path.exists(self.path):
+                    with contextlib.closing(sqlite3.connect(f"file:{self.path}?mode=ro", uri=True)) as database:
+                        self.seen = database.execute("SELECT count(*) FROM events").fetchone()[0]
+
+    def end(self):
+        self.ended.set()
+        self.join()
+        return self.seen
