@@ -1,0 +1,137 @@
+#!/usr/bin/env python3
+"""One local user who writes what harms most: floods, odd bytes, values at every cap.
+
+TESSEL_HOSTILE_POINTS sets the size of the floods.
+"""
+import json
+import os
+import re
+
+import harness
+from harness import Entry, MachineTest, point
+from measure import run_measured
+
+POINTS = int(os.environ.get("TESSEL_HOSTILE_POINTS", "5000" if harness.SANITIZED else "50000"))
+MAX_PAIRS = 4096
+MAX_OPEN_INTERVALS = 65536
+MEMORY = 64 << 10  # KiB that are not pages of files
+ODD = ["\x1b[31mred\x1b[0m\x1b]0;title\x07", "\r\nerror: forged line\n", "%s%n%@%llu%1000000d", "<b>&lt;\"'`$(reboot)",
+       "\u202egnp.exe", "\x00nul", "\x7f\x9b31m\x85", "a" * 4096, "..", "/", "{\"TaskedOn\":true}", "'; DROP TABLE events; --",
+       b"\xff\xfe\xc0\xaf\xed\xa0\x80".decode("utf-8", "surrogateescape"), "\ufeff\ufffe\U0010ffff", ""]
+# What a terminal acts on: control characters but tab and line feed, in every encoding of them.
+TERMINAL = re.compile("[\x00-\x08\x0b-\x1f\x7f-\x9f]")
+
+
+class Flood(MachineTest):
+    def run_flood(self, entries, **extra):
+        self.machine.write_export(entries)
+        cost = run_measured(self.machine, **extra)
+        self.assertEqual(cost.status, 0, cost.stderr[-2000:])
+        print(f"{self.id().split('.')[-1]}: {len(entries)} entries, {cost.anonymous} KiB, {cost.seconds:.1f} s")
+        if not harness.SANITIZED:
+            self.assertLessEqual(cost.anonymous, MEMORY)
+        return cost.log
+
+    def statistics(self):
+        return dict(self.machine.rows()[-1][1])
+
+    def test_each_point_with_a_category_of_its_own(self):
+        entries = [point("event", "com.vantor.Flood", f"Category {i}", "N", telemetry=False, at=-3600 + i * 0.001)
+                   for i in range(POINTS)]
+        log = self.run_flood(entries)
+        delivered = min(POINTS, MAX_PAIRS)
+        statistics = self.statistics()
+        self.assertEqual(statistics["LogObjectsProcessed"], POINTS)
+        self.assertEqual(statistics["EventsNotReported"], delivered)
+        said = [line for line in log if "too many pairs of subsystem and category" in line]
+        self.assertEqual(len(said), 1 if POINTS > delivered else 0)
+        if said:
+            self.assertIn(f" {POINTS - delivered} objects", said[0])
+        # All pairs are listed in the log, the fullest are sent, and each costs its place in the pacing.
+        self.assertEqual(sum("com.vantor.Flood/Category" in line for line in log), delivered)
+        self.assertEqual(len(self.machine.rows()), 5 + 1)
+
+    def test_a_category_of_its_own_and_a_long_one(self):
+        long = "x" * 4000
+        entries = [point("event", "com.vantor.Flood", f"{long}{i}", "N", telemetry=False, at=-3600 + i * 0.001)
+                   for i in range(POINTS // 5)]
+        log = self.run_flood(entries)
+        self.assertLess(self.statistics()["EventsNotReported"], MAX_PAIRS, "text is bounded as well")
+        self.assertTrue(any("too many pairs of subsystem and category" in line for line in log))
+
+    def test_intervals_that_never_end(self):
+        entries = [point("begin", "com.vantor.Flood", "Open", f"N{i % 7}", interval=str(i), telemetry=False,
+                         at=-3600 + i * 0.001, attributes=[("key", "v" * 60 + str(i))]) for i in range(2 * POINTS)]
+        entries.append(point("end", "com.vantor.Flood", "Open", f"N{(2 * POINTS - 1) % 7}", interval=str(2 * POINTS - 1),
+                             telemetry=False, at=-10))
+        log = self.run_flood(entries)
+        self.assertEqual(self.statistics()["IntervalsNotReported"], 1, "the youngest is still open")
+        if 2 * POINTS > MAX_OPEN_INTERVALS:
+            self.assertTrue(any("open intervals were dropped" in line for line in log), log[-5:])
+
+    def test_every_value_is_new_and_as_long_as_may_be(self):
+        entries = []
+        for i in range(POINTS // 10):
+            value = (str(i) + "-" * 4096)[:4096]
+            entries.append(point("event", "com.vantor.Flood", "Long", value, telemetry=False, string1=(value, value),
+                                 string2=(value[::-1], value[::-1]), number1=("n", "9" * 4000),
+                                 attributes=[(str(k), value[2 + k:]) for k in range(8)], at=-3600 + i * 0.001))
+        log = self.run_flood(entries)
+        self.assertEqual(self.statistics()["EventsNotReported"], len(entries), log)
+
+
+class Odd(MachineTest):
+    """Strings that mean something to a terminal, a formatter, a shell, a parser or a database."""
+
+    def entries(self):
+        entries = []
+        for number, text in enumerate(ODD):
+            for field in ("SUBSYSTEM", "CATEGORY", "NAME", "STRING1_NAME", "STRING1_VALUE", "INTERVAL_ID", "DURATION",
+                          "NUMBER1_VALUE", "FRAME_RATE", "KIND", "TELEMETRY", "ATTRIBUTE"):
+                entry = point("event", "com.vantor.Odd", "C", f"N{number}", string1=("label", "week"),
+                              number1=("n", "1"), exe="/opt/" + text, comm=text, at=-600 + len(entries) * 0.001)
+                entry.fields = [pair for pair in entry.fields if pair[0] != "TESSEL_" + field]
+                entry.fields.append(("TESSEL_" + field, text))
+                entries.append(entry)
+        entries.append(Entry([("MESSAGE", "\x1b[2J"), ("TESSEL_KIND", "event")], at=-1))
+        return entries
+
+    def assert_plain(self, text):
+        found = TERMINAL.search(text)
+        self.assertIsNone(found, found and repr(text[max(0, found.start() - 40):found.end() + 40]))
+        self.assertEqual(text, text.encode("utf-8", "replace").decode("utf-8"), "well-formed throughout")
+
+    def run_odd(self, write, internal):
+        self.machine.set_internal(internal)
+        write(self.entries())
+        result = self.machine.run()
+        self.assert_clean(result)
+        self.assert_plain(result.errors)
+        self.assertFalse(any(line.startswith("error: forged") for line in result.errors.splitlines()))
+        rows = self.machine.rows()
+        self.assertGreater(len(rows), 50)
+        for name, payload in rows:
+            json.dumps([name, payload]).encode("utf-8")
+        self.assertEqual(dict(rows[-1][1])["LogObjectsProcessed"], len(self.entries()))
+
+    def test_from_an_export_file(self):
+        self.run_odd(self.machine.write_export, internal=True)
+
+    def test_from_a_journal_and_through_the_whitelist(self):
+        self.run_odd(self.machine.write_journal, internal=False)
+
+    def test_nothing_raw_reaches_a_terminal_through_the_companion(self):
+        self.machine.write_export(self.entries())
+        self.machine.run()
+        for command in (["explain"], ["explain", "--json"], ["explain", "--json", "--payload"], ["explain", "--summary"],
+                        ["explain", "--summary", "--json"], ["events"], ["events", "--json"], ["status"]):
+            result = self.machine.ctl(*command)
+            if result.status == 64 or "not expected" in result.errors:
+                self.skipTest(f"there is no command {command[0]}")
+            with self.subTest(command=command):
+                self.assert_plain(result.out)
+                self.assert_plain(result.errors)
+
+
+if __name__ == "__main__":
+    harness.main()
