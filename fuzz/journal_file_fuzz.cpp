@@ -1,0 +1,88 @@
+// Any bytes as a journal file. What is delivered must keep to the file's own limits: no entry twice,
+// no value beyond what is shown of one, an end.
+//
+// The tables of a real journal file are megabytes of zeros that the reader never looks at. An input
+// therefore begins with where such a stretch stands and how long it is, 32 bits each; the file is
+// made with a hole there.
+
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <span>
+#include <utility>
+
+#include "linux/trace/JournalEntryStream.h"
+#include "linux/trace/TracePointTable.h"
+#include "linux/trace/TraceStore.h"
+
+namespace {
+
+using namespace tessel;
+
+constexpr uint64_t kLongestHole = uint64_t{16} << 20;
+
+void writeAt(int file, std::span<const uint8_t> bytes, uint64_t offset) {
+  if (::pwrite(file, bytes.data(), bytes.size(), static_cast<off_t>(offset)) !=
+      static_cast<ssize_t>(bytes.size()))
+    std::abort();
+}
+
+bool makeFile(int file, std::span<const uint8_t> input) {
+  uint32_t hole[2];
+  if (input.size() < sizeof hole) return false;
+  std::memcpy(hole, input.data(), sizeof hole);
+  const auto bytes = input.subspan(sizeof hole);
+  const size_t before = std::min<size_t>(hole[0], bytes.size());
+  if (::ftruncate(file, 0) != 0) std::abort();
+  writeAt(file, bytes.first(before), 0);
+  writeAt(file, bytes.subspan(before), before + hole[1] % kLongestHole);
+  return true;
+}
+
+void readAll(JournalEntryStream& stream, const TracePointTable& table, size_t most) {
+  size_t entries = 0;
+  while (stream.next()) {
+    if (++entries > most) std::abort();
+    for (const FieldToken token : stream.entry().tokens) {
+      if (table.kind(token) == FieldKind::name && table.text(token).text().size() > 4096)
+        std::abort();
+    }
+  }
+}
+
+// Each input is read as one more file of the same store, so that the megabytes that files share are
+// made once for many.
+uint32_t nextNumber() {
+  static uint32_t runs = 0;
+  return runs++ % TraceStore::kMaxFiles;
+}
+
+JournalReadResources& resources(uint32_t number) {
+  static auto& kept = *new std::unique_ptr<JournalReadResources>;
+  if (number == 0) kept = std::make_unique<JournalReadResources>();
+  return *kept;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static const int file = ::memfd_create("journal", 0);
+  if (!makeFile(file, {data, size})) return 0;
+  const auto opened = readJournalHeader(file);
+  const auto* beginning = std::get_if<JournalBeginning>(&opened);
+  if (beginning == nullptr) return 0;
+  TracePointTable table({.fields = 64, .textBytes = 64 * 1024});
+  StopFlag stop = false;
+  FileReport report;
+  const uint32_t number = nextNumber();
+  JournalEntryStream stream(UniqueFd(::dup(file)), beginning->fileSize, beginning->header, number,
+                            {resources(number), table, stop, report});
+  readAll(stream, table, size / 8);
+  if (report.problems.size() > FileReport::kMaxProblems + 1) std::abort();
+  return 0;
+}

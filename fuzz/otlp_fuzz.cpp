@@ -1,0 +1,52 @@
+// Any name and any text as a row of the spool, and any body as a collector's answer. What is sent
+// must be JSON, and the same row must yield the same bytes.
+
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <nlohmann/json.hpp>
+#include <string_view>
+
+#include "linux/PlainText.h"
+#include "tools/forwarder/OtlpBody.h"
+#include "tools/forwarder/Policy.h"
+
+namespace {
+
+using namespace tessel;
+
+void checkRow(const SpooledEvent& event) {
+  const auto record = otlpRecord(event, "00112233445566778899aabbccddeeff");
+  if (!record) return;
+  if (otlpRecord(event, "00112233445566778899aabbccddeeff") != record) std::abort();
+  if (!nlohmann::json::accept(event.payload)) std::abort();
+  const OutgoingRecord outgoing[] = {{event, *record}, {event, *record}};
+  static const OtlpBody& body = *new OtlpBody({"1", "os", "\xff\"", "amd64", std::nullopt});
+  const auto whole = nlohmann::json::parse(body.around(outgoing), nullptr, false);
+  if (whole.is_discarded()) std::abort();
+}
+
+void checkAnswer(std::string_view body) {
+  CollectorAnswer answer;
+  answer.status = 200;
+  answer.body = body;
+  partialSuccess(answer.body);
+  answer.status = 400;
+  const std::string words = answerWords(answer);
+  if (plainText(words, "") != words || words.find('\n') != std::string::npos) std::abort();
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  const std::string_view text(reinterpret_cast<const char*>(data), size);
+  const size_t nameLength = std::min(text.find('\n'), text.size());
+  SpooledEvent event;
+  event.id = static_cast<int64_t>(size);
+  if (size >= sizeof event.time) std::memcpy(&event.time, data, sizeof event.time);
+  event.name = text.substr(0, nameLength);
+  event.payload = text.substr(std::min(text.size(), nameLength + 1));
+  checkRow(event);
+  checkAnswer(event.payload);
+  return 0;
+}

@@ -1,0 +1,36 @@
+// Any bytes as the tasking configuration: only a dictionary whose TaskedOn is a number other than
+// zero may switch reporting on.
+
+#include <cstdint>
+#include <cstdlib>
+#include <string_view>
+
+#include "linux/statora/ConfigurationJson.h"
+#include "tasking/TaskingGate.h"
+
+namespace {
+
+using namespace tessel;
+
+bool mayReport(const ConfigurationValue* configuration) {
+  if (configuration == nullptr) return false;
+  const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
+  if (dictionary == nullptr || !dictionary->contains("TaskedOn")) return false;
+  const auto* number = std::get_if<Number>(&dictionary->at("TaskedOn").value);
+  return number != nullptr && booleanValue(*number);
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  const std::string_view text(reinterpret_cast<const char*>(data), size);
+  const auto configuration = parseConfiguration(text);
+  const bool decided = taskingDecisionForConfiguration(
+      configuration.get(), "com.vantor.performance.tessel_reporter_tasking");
+  if (decided != mayReport(configuration.get())) std::abort();
+  if (decided && text.find("TaskedOn") == std::string_view::npos &&
+      text.find('\\') == std::string_view::npos)
+    std::abort();
+  if (taskingDecisionForConfiguration(configuration.get(), "com.vantor.other")) std::abort();
+  return 0;
+}
