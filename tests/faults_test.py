@@ -207,6 +207,8 @@ class Clock(FaultTest):
             self.assertEqual(result.status, 0, result.errors)
             self.assertLess(time.monotonic() - before, 30, "pacing must not wait for the wall clock")
             self.assertEqual(machine.stored(), machine.expected)
+            record = machine.record()
+            self.assertAlmostEqual((record["end"] - record["start"]) / 1e6, seconds, delta=60)
             self.assert_next_run_reports(machine)
 
     def test_a_process_that_stays_goes_on_running_however_the_clock_is_set(self):

@@ -10,6 +10,8 @@
 //   FAULT_LINE     text of a log line on standard error, right after which the process is killed
 //   FAULT_DURABLE  directory that a file is copied to whenever it has been flushed
 //   FAULT_CLOCK    file with seconds by which the wall clock is wrong; may appear at any time
+//   FAULT_HURRY    1: a wait of less than two seconds for which nothing comes is over after a
+//                  millisecond, and all clocks have gone on by what it should have taken
 //
 // Calls are counted that change a file: open for creating, write, truncate, flush, map, rename,
 // remove.
@@ -18,6 +20,7 @@
 #include <dlfcn.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <pthread.h>
 #include <signal.h>
 #include <stdarg.h>
 #include <stdatomic.h>
@@ -197,8 +200,37 @@ static long clockIsWrongBy(void) {
   return length > 0 ? atol(text) : 0;
 }
 
+enum { kSecond = 1000000000, kMillisecond = 1000000 };
+
+static atomic_long skipped;  // nanoseconds that were not waited for
+
+static long nanoseconds(const struct timespec* time) {
+  return time->tv_sec * kSecond + time->tv_nsec;
+}
+
+static struct timespec timespecOf(long time) {
+  return (struct timespec){time / kSecond, time % kSecond};
+}
+
 int clock_gettime(clockid_t clock, struct timespec* now) {
   const int result = (int)syscall(SYS_clock_gettime, clock, now);
-  if (result == 0 && clock == CLOCK_REALTIME) now->tv_sec += clockIsWrongBy();
+  if (result != 0) return result;
+  if (clock == CLOCK_REALTIME) now->tv_sec += clockIsWrongBy();
+  if (clock == CLOCK_REALTIME || clock == CLOCK_MONOTONIC || clock == CLOCK_BOOTTIME)
+    *now = timespecOf(nanoseconds(now) + atomic_load(&skipped));
+  return 0;
+}
+
+int pthread_cond_clockwait(pthread_cond_t* condition, pthread_mutex_t* mutex, clockid_t clock,
+                           const struct timespec* until) {
+  struct timespec now;
+  syscall(SYS_clock_gettime, clock, &now);
+  const long deadline = nanoseconds(until) - atomic_load(&skipped);
+  const long remaining = deadline - nanoseconds(&now);
+  const int hurried = number("FAULT_HURRY", 0) != 0 && remaining > kMillisecond &&
+                      remaining < 2L * kSecond;
+  const struct timespec end = timespecOf(hurried ? nanoseconds(&now) + kMillisecond : deadline);
+  const int result = REAL(pthread_cond_clockwait)(condition, mutex, clock, &end);
+  if (hurried && result == ETIMEDOUT) atomic_fetch_add(&skipped, remaining - kMillisecond);
   return result;
 }
