@@ -1,74 +1,24 @@
-// What trace.h puts into the journal's socket, what it refuses, and that it never stands in a
-// program's way.
-
-#include "tessel/trace.h"
+// What trace.h puts into the journal's socket, and what it refuses.
 
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
-#include <atomic>
-#include <climits>
 #include <clocale>
 #include <filesystem>
 #include <fstream>
 #include <limits>
 #include <string>
-#include <thread>
 #include <vector>
 
-#include "FakeJournal.h"
-
-extern "C" {
-int record_while_disabled(void);
-bool enabled_while_disabled(void);
-int record_from_second_unit(void);
-}
+#include "TraceTest.h"
 
 namespace {
 
 using ::testing::Pair;
 using ::testing::UnorderedElementsAre;
 
-class TraceHeader : public ::testing::Test {
- protected:
-  // Each test has a journal of its own, so the socket of the one before is of no use.
-  void SetUp() override { closeTraceSockets(); }
-
-  static tessel_point somePoint() {
-    tessel_point point{};
-    point.subsystem = "com.vantor.Calendar";
-    point.category = "View";
-    point.name = "Open";
-    return point;
-  }
-
-  // Descriptors of this process that are connected to a fake journal, of this test or an old one.
-  static std::vector<int> traceSockets() {
-    std::vector<int> found;
-    for (int fd = 3; fd < 256; ++fd) {
-      sockaddr_un address{};
-      socklen_t size = sizeof address;
-      if (getpeername(fd, reinterpret_cast<sockaddr*>(&address), &size) != 0) continue;
-      if (std::string(address.sun_path).find("tessel-journal") != std::string::npos) {
-        found.push_back(fd);
-      }
-    }
-    return found;
-  }
-  static void closeTraceSockets() {
-    for (const int fd : traceSockets()) close(fd);
-  }
-
-  JournalEntry only() {
-    std::vector<JournalEntry> entries = journal.take();
-    EXPECT_EQ(entries.size(), 1u);
-    return entries.empty() ? JournalEntry{} : entries.front();
-  }
-
-  FakeJournal journal;
-};
+using TraceHeader = TraceTest;
 
 TEST_F(TraceHeader, EventSaysEachThingOnce) {
   const tessel_attribute attributes[] = {{"View", "month"}, {"Empty", ""}};
@@ -354,121 +304,6 @@ TEST_F(TraceHeader, AnimationEndCarriesTheFrameRate) {
   EXPECT_EQ(journal.take().back()["TESSEL_FRAME_RATE"], "59.94");
   tessel_interval_begin(&point, &token);
   EXPECT_EQ(tessel_animation_end(&token, &point, kNotANumber), EINVAL);
-}
-
-TEST_F(TraceHeader, ErrnoBelongsToTheCaller) {
-  const tessel_point point = somePoint();
-  journal.stop();
-  errno = EDOM;
-  EXPECT_NE(tessel_event(&point), 0);
-  EXPECT_EQ(errno, EDOM);
-}
-
-TEST_F(TraceHeader, SurvivesTheJournal) {
-  const tessel_point point = somePoint();
-  journal.stop();
-  EXPECT_EQ(tessel_event(&point), ENOENT);
-  journal.start();
-  EXPECT_EQ(tessel_event(&point), 0);
-  journal.stop();
-  EXPECT_NE(tessel_event(&point), 0);
-  journal.start();
-  EXPECT_EQ(tessel_event(&point), 0);
-  EXPECT_EQ(journal.take().size(), 1u);
-  EXPECT_EQ(traceSockets().size(), 1u);
-}
-
-TEST_F(TraceHeader, AFullJournalCostsTheTracePointAndNotTheCaller) {
-  const tessel_point point = somePoint();
-  int sent = 0;
-  int error = 0;
-  while ((error = tessel_event(&point)) == 0) ASSERT_LT(++sent, 100'000);
-  EXPECT_EQ(error, EAGAIN);
-  EXPECT_EQ(journal.take().size(), static_cast<size_t>(sent));
-  EXPECT_EQ(tessel_event(&point), 0);
-}
-
-TEST_F(TraceHeader, WritesIntoNoDescriptorThatBecameAnothers) {
-  const tessel_point point = somePoint();
-  ASSERT_EQ(tessel_event(&point), 0);
-  ASSERT_EQ(traceSockets().size(), 1u);
-  const int fd = traceSockets().front();
-  int pair[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK, 0, pair), 0);
-  dup2(pair[0], fd);
-  EXPECT_EQ(tessel_event(&point), 0);
-  char byte = 0;
-  EXPECT_EQ(recv(pair[1], &byte, 1, 0), -1);
-  EXPECT_EQ(journal.take().size(), 2u);
-  for (const int each : {fd, pair[0], pair[1]}) close(each);
-}
-
-TEST_F(TraceHeader, KeepsOffTheStandardStreams) {
-  const int input = dup(0);
-  const tessel_point point = somePoint();
-  close(0);
-  EXPECT_EQ(tessel_event(&point), 0);
-  EXPECT_EQ(fcntl(0, F_GETFD), -1);
-  dup2(input, 0);
-  close(input);
-}
-
-TEST_F(TraceHeader, AForkedChildGoesOnRecording) {
-  const tessel_point point = somePoint();
-  ASSERT_EQ(tessel_event(&point), 0);
-  const pid_t child = fork();
-  if (child == 0) _exit(tessel_event(&point));
-  int status = -1;
-  waitpid(child, &status, 0);
-  EXPECT_EQ(status, 0);
-  EXPECT_EQ(tessel_event(&point), 0);
-  EXPECT_EQ(journal.take().size(), 3u);
-}
-
-TEST_F(TraceHeader, ThreadsShareOneSocketAndLoseNothing) {
-  constexpr int kThreads = 8;
-  constexpr int kEach = 200;
-  std::atomic<int> running = kThreads;
-  std::vector<std::thread> threads;
-  threads.reserve(kThreads);
-  for (int i = 0; i < kThreads; ++i) {
-    threads.emplace_back([&running] {
-      const tessel_point point = somePoint();
-      for (int sent = 0; sent < kEach;) sent += tessel_event(&point) == 0;
-      --running;
-    });
-  }
-  size_t received = 0;
-  while (running > 0) received += journal.take().size();
-  for (std::thread& thread : threads) thread.join();
-  EXPECT_EQ(received + journal.take().size(), size_t{kThreads} * kEach);
-  EXPECT_EQ(traceSockets().size(), 1u);
-}
-
-TEST_F(TraceHeader, UnitsOfOneProgramShareSocketAndSwitch) {
-  const tessel_point point = somePoint();
-  EXPECT_EQ(tessel_event(&point), 0);
-  EXPECT_EQ(record_from_second_unit(), 0);
-  EXPECT_EQ(traceSockets().size(), 1u);
-  tessel_enable(false);
-  EXPECT_EQ(record_from_second_unit(), 0);
-  EXPECT_EQ(tessel_event(&point), 0);
-  tessel_enable(true);
-  EXPECT_EQ(journal.take().size(), 2u);
-}
-
-TEST_F(TraceHeader, DisabledAtCompileTimeDoesNothing) {
-  EXPECT_FALSE(enabled_while_disabled());
-  EXPECT_EQ(record_while_disabled(), 0);
-  EXPECT_TRUE(journal.take().empty());
-}
-
-TEST_F(TraceHeader, TheEnvironmentSwitchesItOff) {
-  const std::string command = std::string(TRACE_RECORDER) + " 3 > /dev/null";
-  ASSERT_EQ(std::system(("TESSEL_TRACE=0 " + command).c_str()), 0);
-  EXPECT_TRUE(journal.take().empty());
-  ASSERT_EQ(std::system(("TESSEL_TRACE=1 " + command).c_str()), 0);
-  EXPECT_EQ(journal.take().size(), 5u);
 }
 
 }  // namespace

@@ -1,0 +1,53 @@
+// The fixture of the header's tests: a journal of the test's own, and the program's sockets to it.
+
+#pragma once
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include "FakeJournal.h"
+#include "tessel/trace.h"
+
+class TraceTest : public ::testing::Test {
+ protected:
+  // Each test has a journal of its own, so the socket of the one before is of no use.
+  void SetUp() override { closeTraceSockets(); }
+
+  static tessel_point somePoint() {
+    tessel_point point{};
+    point.subsystem = "com.vantor.Calendar";
+    point.category = "View";
+    point.name = "Open";
+    return point;
+  }
+
+  // Descriptors of this process that are connected to a fake journal, of this test or an old one.
+  static std::vector<int> traceSockets() {
+    std::vector<int> found;
+    for (int fd = 3; fd < 256; ++fd) {
+      sockaddr_un address{};
+      socklen_t size = sizeof address;
+      if (getpeername(fd, reinterpret_cast<sockaddr*>(&address), &size) != 0) continue;
+      if (std::string(address.sun_path).find("tessel-journal") != std::string::npos) {
+        found.push_back(fd);
+      }
+    }
+    return found;
+  }
+  static void closeTraceSockets() {
+    for (const int fd : traceSockets()) close(fd);
+  }
+
+  JournalEntry only() {
+    std::vector<JournalEntry> entries = journal.take();
+    EXPECT_EQ(entries.size(), 1u);
+    return entries.empty() ? JournalEntry{} : entries.front();
+  }
+
+  FakeJournal journal;
+};
