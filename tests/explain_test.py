@@ -3,6 +3,7 @@
 import html.parser
 import json
 import os
+import subprocess
 import time
 
 import harness
@@ -227,6 +228,29 @@ class Follow(ExplainTest):
         lines, _ = self.shown(process, 3)
         self.assertEqual([(line["name"], line["kind"]) for line in lines],
                          [("First", "Event"), ("Span", "Interval"), ("Twin", "Event")])
+
+
+    LIVE = """
+        "$0" explain --follow --json >"$1" & follower=$!
+        sleep 1.5
+        printf '%s\\n' MESSAGE=tessel TESSEL_KIND=event TESSEL_SUBSYSTEM=com.vantor.Calendar TESSEL_CATEGORY=View \
+            TESSEL_NAME=Open TESSEL_TELEMETRY=1 TESSEL_STRING1_NAME=period TESSEL_STRING1_VALUE=weekly | logger --journald
+        for _ in $(seq 200); do [ -s "$1" ] && break; sleep 0.05; done
+        sleep 1; kill $follower
+    """
+
+    def test_what_logger_records_in_a_real_journal_shows_up_once_with_its_reason(self):
+        shown = os.path.join(self.machine.root, "shown")
+        environment = self.machine.environment(TESSEL_TRACE_STORE=None)
+        result = subprocess.run([os.path.join(os.path.dirname(os.path.abspath(__file__)), "with-journald"), "sh", "-c",
+                                 self.LIVE, os.path.join(harness.BIN, "tesselctl"), shown],
+                                env=environment, capture_output=True, text=True, check=False, timeout=120)
+        if result.returncode == harness.SKIPPED:
+            self.skipTest(result.stderr)
+        with open(shown, encoding="utf-8") as file:
+            lines = [json.loads(line) for line in file]
+        self.assertEqual([(line["subsystem"], line["verdict"], line["rule"]["value"]) for line in lines],
+                         [("com.vantor.Calendar", "string_whitelist", "weekly")], result.stderr)
 
 
 class PageReader(html.parser.HTMLParser):

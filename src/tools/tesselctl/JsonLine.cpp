@@ -2,11 +2,27 @@
 
 #include "tools/tesselctl/JsonLine.h"
 
+#include <algorithm>
+
 #include "tools/tesselctl/ShownText.h"
 
 namespace tessel::ctl {
 
+namespace {
+
+bool needsNoEscape(std::string_view text) {
+  return std::all_of(text.begin(), text.end(), [](char byte) {
+    return byte >= 0x20 && byte < 0x7f && byte != '"' && byte != '\\';
+  });
+}
+
+}  // namespace
+
 void appendJsonText(std::string& out, std::string_view text) {
+  if (needsNoEscape(text)) {
+    out.append(1, '"').append(text).append(1, '"');
+    return;
+  }
   std::string literal;
   appendJsonString(literal, text);
   out += terminalJson(literal);
