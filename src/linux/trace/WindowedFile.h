@@ -23,7 +23,7 @@ class WindowBudget {
  public:
   static constexpr size_t kTotal = size_t{12} << 20;
   static constexpr size_t kSmallest = size_t{1} << 10;
-  static constexpr size_t kLargest = size_t{256} << 10;
+  static constexpr size_t kLargest = size_t{128} << 10;
 
   void join() { ++readers_; }
   void leave() { --readers_; }
