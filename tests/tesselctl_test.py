@@ -12,6 +12,7 @@ import time
 
 import harness
 from harness import BIN, TASKING, MachineTest, log_event, point
+from otlp_receiver import Answer, Receiver
 
 HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "two\nlines", "tab\tand\rreturn",
            "\x7fdelete", "caf\udce9", "\u2028separator"]
@@ -255,6 +256,23 @@ class Status(CtlTest):
         self.assertNotIn("last_run", status)
         self.assertEqual(status["spool"]["state"], "absent")
         self.assertEqual(os.listdir(self.machine.state), [])
+
+    def test_the_forwarders_counters_are_shown_once_it_worked(self):
+        self.run_once()
+        self.assertNotIn("forwarder", self.status()[1])
+        with Receiver(lambda request, number: Answer(503 if number == 0 else 200)) as receiver:
+            subprocess.run([os.path.join(BIN, "statora_forwarder"), "--once"], check=True, capture_output=True,
+                           env={"TESSEL_STATE_DIR": self.machine.state, "OTEL_EXPORTER_OTLP_ENDPOINT": receiver.url,
+                                "TESSEL_FORWARD_RATE": "0", "TESSEL_FORWARD_RETRY": "1"})
+        exit_status, status = self.status()
+        delivered = len(receiver.accepted_uids())
+        self.assertEqual(exit_status, 0, "the run's books balance although the rows are gone")
+        self.assertEqual(status["spool"]["rows"], 0)
+        self.assertGreater(delivered, 0)
+        forwarder = status["forwarder"]
+        self.assertEqual([forwarder[key] for key in ("delivered", "requests", "retries", "set_aside", "position")],
+                         [delivered, 2, 1, 0, delivered])
+        self.assertIn(f"{delivered} delivered in 2 requests", self.machine.ctl("status").out)
 
     def test_the_books_of_a_run_balance_and_cooked_ones_do_not(self):
         self.run_once()

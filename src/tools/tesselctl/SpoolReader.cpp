@@ -108,6 +108,7 @@ std::optional<SpoolContents> SpoolReader::contents() {
     contents.oldest = database_.integer("SELECT time FROM events ORDER BY id LIMIT 1");
     contents.newest = database_.integer("SELECT time FROM events ORDER BY id DESC LIMIT 1");
   }
+  contents.forwarder = readForwarderCounters(database_);
   return contents;
 }
 

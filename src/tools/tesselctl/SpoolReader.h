@@ -14,6 +14,7 @@
 #include <string>
 #include <string_view>
 
+#include "linux/statora/ForwarderState.h"
 #include "linux/statora/Sqlite.h"
 
 namespace tessel::ctl {
@@ -30,7 +31,8 @@ struct SpoolContents {
   int64_t rows = 0;
   std::optional<int64_t> oldest;  // microseconds since 1970; absent where it is empty
   std::optional<int64_t> newest;
-  uint64_t bytes = 0;  // database and write-ahead log
+  uint64_t bytes = 0;                          // database and write-ahead log
+  std::optional<ForwarderCounters> forwarder;  // absent where none ever worked on it
 };
 
 class SpoolReader {

@@ -165,6 +165,16 @@ void writeSpool(std::string& out, const Status& status) {
   object.end();
 }
 
+void writeForwarder(std::string& out, const ForwarderCounters& counters) {
+  JsonObject object(out);
+  object.count("delivered", counters.delivered).count("rejected", counters.rejected);
+  object.count("set_aside", counters.setAside).count("set_aside_dropped", counters.setAsideDropped);
+  object.count("requests", counters.requests).count("retries", counters.retries);
+  object.count("bytes_sent", counters.bytesSent).count("position", counters.position);
+  object.count("last_success", counters.lastSuccess);
+  object.end();
+}
+
 std::string statusJson(const Status& status) {
   std::string out;
   JsonObject object(out);
@@ -197,6 +207,10 @@ std::string statusJson(const Status& status) {
   }
   addDate(object, "last_begin", status.lastBegin);
   object.nested("spool", [&](std::string& inner) { writeSpool(inner, status); });
+  if (status.spool.forwarder) {
+    object.nested("forwarder",
+                  [&](std::string& inner) { writeForwarder(inner, *status.spool.forwarder); });
+  }
   object.nested("journal", [&](std::string& inner) {
     JsonObject journal(inner);
     addDate(journal, "oldest", status.journal.oldest);
@@ -224,6 +238,7 @@ class Screen {
     lastRun();
     marker();
     spool();
+    if (status_.spool.forwarder) forwarder(*status_.spool.forwarder);
     journal();
     return out_;
   }
@@ -336,6 +351,20 @@ class Screen {
                dateText(Date{std::chrono::microseconds{*spool.newest}});
     }
     line("Spool", grouped(static_cast<uint64_t>(spool.rows)) + " rows", Colour::plain, words);
+  }
+
+  void forwarder(const ForwarderCounters& counters) {
+    const bool trouble = counters.rejected + counters.setAside > 0;
+    std::string words = grouped(counters.delivered) + " delivered in " +
+                        counted(counters.requests, "request", "requests") + ", " +
+                        grouped(counters.retries) + " again, " + grouped(counters.rejected) +
+                        " rejected, " + grouped(counters.setAside) + " set aside";
+    if (counters.lastSuccess != 0) {
+      const auto last = static_cast<int64_t>(counters.lastSuccess);
+      words += "; last " + since(Date{std::chrono::microseconds{last}});
+    }
+    line("Forwarder", trouble ? "refused some" : "in use",
+         trouble ? Colour::caution : Colour::plain, words);
   }
 
   void journal() {
