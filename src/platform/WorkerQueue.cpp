@@ -34,17 +34,15 @@ WorkerQueue::WorkerQueue(std::string label) : state_(std::make_shared<State>(std
 const std::string& WorkerQueue::label() const { return state_->label; }
 
 void WorkerQueue::async(Closure work) {
-  bool startThread = false;
-  {
-    const std::lock_guard lock(state_->mutex);
-    state_->work.push_back(std::move(work));
-    startThread = !std::exchange(state_->hasThread, true);
-  }
-  if (startThread) {
-    std::thread([state = state_] { drain(state); }).detach();
-  } else {
+  const std::lock_guard lock(state_->mutex);
+  state_->work.push_back(std::move(work));
+  if (std::exchange(state_->hasThread, true)) {
     state_->arrived.notify_one();
+    return;
   }
+  // Under the lock, without which the thread cannot end: detach() of the C library still reads what
+  // a thread that ends meanwhile gives back to the system.
+  std::thread([state = state_] { drain(state); }).detach();
 }
 
 void WorkerQueue::sync(const Closure& work) {
