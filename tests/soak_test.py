@@ -1,0 +1,65 @@
+#!/usr/bin/env python3
+"""Many runs in one process whose clocks are hurried on: memory, threads and descriptors stay as they are.
+
+TESSEL_SOAK_RUNS says how many runs.
+"""
+import contextlib
+import os
+import sqlite3
+import time
+
+import harness
+from harness import BIN, MachineTest, point
+from measure import anonymous_memory
+
+RUNS = int(os.environ.get("TESSEL_SOAK_RUNS", "120"))
+# The poll of a past run goes on, and takes this much at most.
+BYTES_PER_RUN = 2048
+SLACK = 2 << 20  # what the allocator and idle threads take or give at one moment
+
+
+class Soak(MachineTest):
+    def figures(self, process, runs):
+        """Once so many runs are done: memory that is not pages of files in bytes, threads, descriptors."""
+        deadline = time.monotonic() + 60 + runs
+        while self.runs_done() < runs:
+            self.assertIsNone(process.poll(), "it must stay")
+            self.assertLess(time.monotonic(), deadline, f"{self.runs_done()} runs")
+            time.sleep(0.05)
+        counts = [len(os.listdir(f"/proc/{process.pid}/{kind}")) for kind in ("task", "fd")]
+        # The least of many looks is that of a moment between two runs.
+        memory = min(anonymous_memory(process.pid) for _ in self.looks()) * 1024
+        print(f"after {runs} runs: {memory} bytes, {counts[0]} threads, {counts[1]} descriptors", flush=True)
+        return memory, *counts
+
+    @staticmethod
+    def looks():
+        for _ in range(200):
+            yield time.sleep(0.01)
+
+    def runs_done(self):
+        try:
+            uri = f"file:{self.machine.state}/statora.db?mode=ro"
+            with contextlib.closing(sqlite3.connect(uri, uri=True)) as database:
+                return database.execute("SELECT ifnull(max(id), 0) FROM events").fetchone()[0] // 8
+        except sqlite3.OperationalError:
+            return 0  # not made yet, or just being written
+
+    @harness.unittest.skipIf(harness.SANITIZED, "a sanitizer keeps what is freed")
+    def test_many_runs_leave_little_behind(self):
+        self.machine.write_export([point("event", "com.vantor.Calendar", "View", f"Open{i}") for i in range(2)])
+        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1", TESSEL_LOG_LEVEL="error", FAULT_HURRY="1",
+                                     LD_PRELOAD=os.path.join(BIN, "fault_shim.so"))
+        self.addCleanup(process.kill)
+        at = [RUNS // 4, RUNS // 2, RUNS]
+        seen = [self.figures(process, runs) for runs in at]
+        process.kill()
+        self.assertEqual(self.machine.result(process).errors, "")
+        growth = (seen[2][0] - seen[1][0]) / (at[2] - at[1])
+        print(f"{growth:.0f} bytes a run")
+        self.assertLess(seen[2][0] - seen[1][0], BYTES_PER_RUN * (at[2] - at[1]) + SLACK)
+        self.assertLessEqual(seen[2][2], seen[0][2] + 4)
+
+
+if __name__ == "__main__":
+    harness.main()
