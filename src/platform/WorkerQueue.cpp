@@ -16,7 +16,9 @@
 namespace tessel {
 
 namespace {
-constexpr std::chrono::seconds kIdleThreadLife{1};
+// Long enough for the next of a row of closures, short enough that the polls of a thousand past runs,
+// each on a queue of its own, do not add up to a crowd of idle threads.
+constexpr std::chrono::milliseconds kIdleThreadLife{20};
 }
 
 struct WorkerQueue::State {

@@ -1,7 +1,7 @@
 // WorkerQueue and WorkerQueueFactory: serial queues and timers on threads, standard library alone.
 //
 // A queue has a thread only while it has work: the thread comes with the first closure and leaves
-// after a second without any, so that an idle queue costs a few hundred bytes. All timers of the
+// a moment after the last of it, so that an idle queue costs a few hundred bytes. All timers of the
 // process share one thread, which does nothing but submit to queues. Threads are never joined, and
 // what they use is never destroyed, so the process may end at any moment.
 
