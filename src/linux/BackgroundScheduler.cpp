@@ -107,7 +107,7 @@ RunLock ActivityDeliveries::waitForTurn() {
     const std::optional<Date> lastRunSeen = waitUntilDue();
     std::optional<RunLock> turn = waitForLock();
     if (!turn) {
-      tesselReporterLog().error("Could not lock the state directory %@", state_.path());
+      tesselReporterLog().debug("Could not lock the state directory %@", state_.path());
       waitForRetry();
     } else if (!criteria_.interval || lastRun() == lastRunSeen) {
       return std::move(*turn);
@@ -144,7 +144,7 @@ std::optional<Date> ActivityDeliveries::lastRun() const {
 void ActivityDeliveries::record(Date begin) {
   lastRunHere_ = begin;
   if (const std::optional<std::string> error = state_.recordRun(begin)) {
-    tesselReporterLog().error("Could not record the run: %@", *error);
+    tesselReporterLog().debug("Could not record the run: %@", *error);
   }
 }
 

@@ -177,14 +177,14 @@ TEST_F(ActivityDeliveriesTest, ARunOfAnotherProcessDuringTheWaitStartsTheWaitAga
 }
 
 TEST_F(ActivityDeliveriesTest, ARunThatCannotBeRecordedIsSaidAndNotRepeatedAtOnce) {
-  const testing::RecordingLog log(LogLevel::error);
+  const testing::RecordingLog log;
   std::filesystem::create_directory(state_.path() + "/scheduler-last-run.new");
   ActivityDeliveries hourly = deliveries({hours{1}, seconds{900}});
   hourly.deliverRun();
   hourly.deliverRun();
   EXPECT_EQ(begins_[1] - begins_[0], hours{1});
-  EXPECT_THAT(log.errors(), ::testing::Each(::testing::StartsWith("Could not record the run: ")));
-  EXPECT_EQ(log.errors().size(), 2u);
+  EXPECT_THAT(log.lines(), ::testing::Each(::testing::StartsWith("Could not record the run: ")));
+  EXPECT_EQ(log.lines().size(), 2u);
 }
 
 TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgainAfterTheRetryTimeAndNotRecorded) {

@@ -89,7 +89,7 @@ void addStore(RunRecord& record, const ExtractionReport& found) {
   uint64_t skipped = 0;
   uint64_t damaged = 0;
   for (const FileReport& file : found.store.files) {
-    skipped += file.skipped ? 1 : 0;
+    skipped += file.skipped && !file.outsideRange ? 1 : 0;
     damaged += file.problems.empty() ? 0 : 1;
   }
   record.logEvents = found.entriesRead;

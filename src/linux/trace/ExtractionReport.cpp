@@ -15,7 +15,7 @@ void logCount(uint64_t count, std::string_view what) {
 void logFiles(const StoreReport& store) {
   uint64_t problems = 0;
   for (const FileReport& file : store.files) {
-    if (file.skipped) {
+    if (file.skipped && !file.outsideRange) {
       tesselReporterLog().debug("Trace store: %@ was not read: %@", file.path, *file.skipped);
     }
     for (const FileProblem& problem : file.problems) {

@@ -26,6 +26,7 @@ struct FileReport {
   std::string path;
   uint64_t entriesRead = 0;            // of those in the range
   std::optional<std::string> skipped;  // why the file was not read; absent where it was
+  bool outsideRange = false;           // that is why: it has nothing for the range, and all is well
   std::vector<FileProblem> problems;
 
   void addProblem(std::string_view reason, uint64_t place, uint64_t count = 1);

@@ -66,6 +66,11 @@ void SequenceWatch::change(const EntryHeader& entry) {
   }
 }
 
+// What the header says of a file whose layout is not known, as far as the file can hold it.
+uint64_t plausibleEntries(const JournalHeader& header, uint64_t size) {
+  return std::min(header.entryCount, size / journal_format::kEntryItemsAt);
+}
+
 }  // namespace
 
 struct TraceStore::State final : EntryStream {
@@ -149,8 +154,8 @@ std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uin
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
-    auto foreign =
-        ForeignJournalStream::start(file.path, header.entryCount, tokenizer, stop, report);
+    auto foreign = ForeignJournalStream::start(file.path, plausibleEntries(header, size), tokenizer,
+                                               stop, report);
     if (!foreign) report.skipped = "written with features that are not known";
     usableFiles += foreign != nullptr;
     return foreign;
@@ -159,6 +164,7 @@ std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uin
   if (header.headRealtime != 0) seeTime(header.headRealtime);
   if (outsideRange(header)) {
     report.skipped = "outside the range";
+    report.outsideRange = true;
     return nullptr;
   }
   return std::make_unique<JournalEntryStream>(

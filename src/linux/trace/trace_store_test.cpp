@@ -160,6 +160,7 @@ TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
   const Reading reading = readStore(directory.path(), {kBase + 13'000'000, kBase + 16'000'000});
   EXPECT_EQ(numbers(reading), (std::vector<uint64_t>{13, 14, 15}));
   EXPECT_EQ(reading.report.files.at(0).skipped, "outside the range");
+  EXPECT_TRUE(reading.report.files.at(0).outsideRange);
   EXPECT_EQ(reading.report.files.at(1).entriesRead, 3u);
   EXPECT_FALSE(reading.report.files.at(2).skipped);
   EXPECT_EQ(reading.report.oldestEntry, kBase + 1'000'000);
@@ -222,6 +223,8 @@ TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
   std::string file = someJournal(10);
   file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
   directory.write("foreign.journal", file);
+  file.replace(journal_format::kEntryCountAt, 8, 8, '\xff');
+  directory.write("foreign_boast.journal", file);
   directory.write("known.journal", someJournal(10));
   const Reading reading = readStore(directory.path());
   EXPECT_EQ(reading.entries.size(), 10u);
@@ -229,6 +232,8 @@ TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
   const FileProblem& last = reading.report.files.at(0).problems.back();
   EXPECT_EQ(last.reason, "entries that journalctl did not read");
   EXPECT_EQ(last.count, 10u);
+  EXPECT_LE(reading.report.files.at(1).problems.back().count, file.size())
+      << "no more than the file can hold";
 }
 
 TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {

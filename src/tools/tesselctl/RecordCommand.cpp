@@ -20,16 +20,17 @@ namespace tessel::ctl {
 
 namespace {
 
-constexpr const char* kHelp =
-    "Records a trace point: an event, the begin or the end of an interval, or an interval around "
-    "a\n"
-    "command.\n\n"
+constexpr const char* kDescription =
+    "Record a trace point: an event, the begin or the end of an interval, or an interval around a "
+    "command";
+
+constexpr const char* kFooter =
+    "Examples:\n"
     "  tesselctl record event com.vantor.Calendar View Open --telemetry --string1 period=week\n"
     "  tesselctl record begin com.vantor.Render Frame Draw --id 7\n"
     "  tesselctl record end   com.vantor.Render Frame Draw --id 7 --frame-rate 59.9\n"
-    "  tesselctl record --subsystem com.vantor.Backup --category Job -- rsync -a /home /mnt";
-
-constexpr const char* kFooter =
+    "  tesselctl record --subsystem com.vantor.Backup --category Job -- rsync -a /home "
+    "/mnt\n\n"
     "A begin and its end match on subsystem, category, name and --id, and in process scope on the\n"
     "process. 'record begin' and 'record end' are two processes, so their scope is 'system' "
     "unless\n"
@@ -243,7 +244,7 @@ int recordCommandLine(const CLI::App& app, const Invocation& invocation,
 
 void addRecordCommand(CLI::App& app, Invocation& invocation) {
   auto options = std::make_shared<RecordOptions>();
-  CLI::App* record = app.add_subcommand("record", kHelp);
+  CLI::App* record = app.add_subcommand("record", kDescription);
   record->footer(kFooter);
   record->require_subcommand(0, 1);
   addKind(*record, invocation, *options, "event", "One moment");

@@ -199,7 +199,7 @@ std::string fileLines(const StoreReport& store, const Terminal& terminal) {
                {"TIMES", Table::Align::right},
                {"FILE", Table::Align::left, true}});
   for (const FileReport& file : store.files) {
-    if (file.skipped)
+    if (file.skipped && !file.outsideRange)
       table.add({"not read: " + terminalText(*file.skipped), "", terminalText(file.path)});
     for (const FileProblem& problem : file.problems) {
       table.add({terminalText(problem.reason), grouped(problem.count), terminalText(file.path)});
