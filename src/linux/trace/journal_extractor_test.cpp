@@ -163,10 +163,11 @@ class EndlessStream final : public EntryStream {
 
 TEST_F(JournalExtractorTest, aStopFromAnotherThreadTakesEffectWhereNothingIsDelivered) {
   EndlessStream stream;
-  std::thread stopper([&] { extractor().stopProcessing(); });
-  extractor().processEntries(stream);
+  JournalExtractor& running = extractor();  // made before there are two threads
+  std::thread stopper([&] { running.stopProcessing(); });
+  running.processEntries(stream);
   stopper.join();
-  EXPECT_TRUE(extractor().report().stopped);
+  EXPECT_TRUE(running.report().stopped);
 }
 
 TEST_F(JournalExtractorTest, aStoreOnDiskIsReadWithinTheRange) {
