@@ -46,7 +46,7 @@ class ReportingRunTest : public ::testing::Test {
   testing::FakeDates dates;
   std::shared_ptr<testing::FakeExtractor> extractor = std::make_shared<testing::FakeExtractor>();
   std::shared_ptr<testing::FakeActivity> activity = std::make_shared<testing::FakeActivity>();
-  testing::RememberingStatus status;
+  testing::FakeServiceStatus status;
   std::vector<RunReport> reports;
 
   TaskingGate gate{variant, configurations, queues, clock};
@@ -81,7 +81,7 @@ TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
   EXPECT_FALSE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(activity->statesSet.empty());
   EXPECT_EQ(reports.at(0).ending, RunEnding::completed);
-  EXPECT_EQ(status.words,
+  EXPECT_EQ(status.said,
             (std::vector<std::string>{"waiting for the tasking configuration",
                                       "reading the trace store", "summarising", "idle"}));
 }

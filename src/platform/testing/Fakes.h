@@ -190,14 +190,6 @@ struct FakeBuildVariant final : BuildVariant {
   std::string lastSubsystem;
 };
 
-struct RememberingStatus final : ServiceStatus {
-  void say(std::string_view said) override { words.emplace_back(said); }
-  void progress() override { ++steps; }
-
-  std::vector<std::string> words;
-  size_t steps = 0;
-};
-
 // Formats a date as its seconds since 1970.
 struct FakeDates final : DateFormatter {
   std::string format(Date date) override;
