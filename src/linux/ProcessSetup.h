@@ -9,7 +9,9 @@ namespace tessel {
 //    signal source instead of ending the process by the signal;
 //  - ignores SIGPIPE: a reader of the log that went away is no reason to end;
 //  - opens /dev/null for each standard descriptor that is closed, so that no file that is opened
-//    later takes its number and receives log lines.
+//    later takes its number and receives log lines;
+//  - has the heap give large blocks back, so that a process that stays does not hold between two
+//    runs what the last one took.
 void prepareProcess();
 
 // Blocks `signalNumber` in the calling thread and in those that it starts.

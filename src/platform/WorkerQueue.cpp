@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <condition_variable>
 #include <deque>
+#include <list>
 #include <mutex>
 #include <queue>
 #include <thread>
@@ -16,19 +17,63 @@
 namespace tessel {
 
 namespace {
-// Long enough for the next of a row of closures, short enough that the polls of a thousand past runs,
-// each on a queue of its own, do not add up to a crowd of idle threads.
+// Long enough for the next of a row of closures, short enough that idle threads do not add up.
 constexpr std::chrono::milliseconds kIdleThreadLife{20};
-}
+}  // namespace
 
 struct WorkerQueue::State {
   explicit State(std::string name) : label(std::move(name)) {}
 
   const std::string label;
   std::mutex mutex;
-  std::condition_variable arrived;
-  std::deque<Closure> work;
-  bool hasThread = false;
+  std::list<Closure> work;  // a list takes nothing from the heap while it is empty
+  bool hasThread = false;   // or is about to have one
+};
+
+// The threads of all queues. A queue that gets work waits for one that is idle, or gets a new one.
+class WorkerQueue::Threads {
+ public:
+  static Threads& shared() {
+    static Threads& instance = *new Threads;
+    return instance;
+  }
+
+  void take(std::shared_ptr<State> queue) {
+    const std::lock_guard lock(mutex_);
+    waiting_.push_back(std::move(queue));
+    if (idle_ >= waiting_.size()) {
+      arrived_.notify_one();
+      return;
+    }
+    // Under the lock, without which the thread cannot end: detach() of the C library still reads
+    // what a thread that ends meanwhile gives back to the system.
+    std::thread([this] { run(); }).detach();
+  }
+
+ private:
+  void run() {
+    std::unique_lock lock(mutex_);
+    while (waitForQueue(lock)) {
+      const std::shared_ptr<State> queue = std::move(waiting_.front());
+      waiting_.pop_front();
+      lock.unlock();
+      drain(*queue);
+      lock.lock();
+    }
+  }
+
+  bool waitForQueue(std::unique_lock<std::mutex>& lock) {
+    ++idle_;
+    const bool came =
+        arrived_.wait_for(lock, kIdleThreadLife, [this] { return !waiting_.empty(); });
+    --idle_;
+    return came;
+  }
+
+  std::mutex mutex_;
+  std::condition_variable arrived_;
+  std::deque<std::shared_ptr<State>> waiting_;
+  size_t idle_ = 0;
 };
 
 WorkerQueue::WorkerQueue(std::string label) : state_(std::make_shared<State>(std::move(label))) {}
@@ -36,15 +81,12 @@ WorkerQueue::WorkerQueue(std::string label) : state_(std::make_shared<State>(std
 const std::string& WorkerQueue::label() const { return state_->label; }
 
 void WorkerQueue::async(Closure work) {
-  const std::lock_guard lock(state_->mutex);
-  state_->work.push_back(std::move(work));
-  if (std::exchange(state_->hasThread, true)) {
-    state_->arrived.notify_one();
-    return;
+  {
+    const std::lock_guard lock(state_->mutex);
+    state_->work.push_back(std::move(work));
+    if (std::exchange(state_->hasThread, true)) return;
   }
-  // Under the lock, without which the thread cannot end: detach() of the C library still reads what
-  // a thread that ends meanwhile gives back to the system.
-  std::thread([state = state_] { drain(state); }).detach();
+  Threads::shared().take(state_);
 }
 
 void WorkerQueue::sync(const Closure& work) {
@@ -57,20 +99,17 @@ void WorkerQueue::sync(const Closure& work) {
   }
 }
 
-void WorkerQueue::drain(const std::shared_ptr<State>& state) {
-  std::unique_lock lock(state->mutex);
-  for (;;) {
-    if (!state->arrived.wait_for(lock, kIdleThreadLife, [&] { return !state->work.empty(); })) {
-      state->hasThread = false;
-      return;
-    }
-    Closure work = std::move(state->work.front());
-    state->work.pop_front();
+void WorkerQueue::drain(State& state) {
+  std::unique_lock lock(state.mutex);
+  while (!state.work.empty()) {
+    Closure work = std::move(state.work.front());
+    state.work.pop_front();
     lock.unlock();
     work();
     work = nullptr;
     lock.lock();
   }
+  state.hasThread = false;
 }
 
 namespace {

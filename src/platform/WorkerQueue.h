@@ -1,9 +1,11 @@
 // WorkerQueue and WorkerQueueFactory: serial queues and timers on threads, standard library alone.
 //
-// A queue has a thread only while it has work: the thread comes with the first closure and leaves
-// a moment after the last of it, so that an idle queue costs a few hundred bytes. All timers of the
-// process share one thread, which does nothing but submit to queues. Threads are never joined, and
-// what they use is never destroyed, so the process may end at any moment.
+// A queue has a thread only while it has work, and an idle queue costs a few hundred bytes. A
+// thread that has emptied its queue takes the next one that has work, and leaves where none comes
+// within a moment; a queue that finds no idle thread gets a new one, so that no queue waits for
+// another. All timers of the process share one thread, which does nothing but submit to queues.
+// Threads are never joined, and what they use is never destroyed, so the process may end at any
+// moment.
 
 #pragma once
 
@@ -21,7 +23,8 @@ class WorkerQueue final : public SerialQueue {
 
  private:
   struct State;
-  static void drain(const std::shared_ptr<State>& state);
+  class Threads;
+  static void drain(State& state);
 
   std::shared_ptr<State> state_;
 };

@@ -145,7 +145,9 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   return keep<ReportingRun>(
       gate, cookie, RunSurroundings{status, queues, clock, keep<MountTable>(), variant},
       [store = launch.traceStore, &status] {
-        auto extractor = std::make_shared<JournalExtractor>(store);
+        // Not make_shared(), with which the weak reference of a past run's poll would hold the
+        // whole extractor's memory.
+        std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store));
         extractor->reportProgressTo(status);
         return extractor;
       },
