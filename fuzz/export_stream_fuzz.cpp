@@ -38,7 +38,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   tessel::TracePointTable table({.fields = 64, .textBytes = 64 * 1024});
   tessel::StopFlag stop = false;
   tessel::FileReport report;
-  tessel::ExportEntryStream stream(::open(path.c_str(), O_RDONLY), table, stop, report);
+  tessel::WindowBudget windows;
+  tessel::ExportReadResources resources{windows};
+  tessel::ExportEntryStream stream(::open(path.c_str(), O_RDONLY), resources, table, stop, report);
   readAll(stream, table);
   constexpr std::string_view kGood = "\n\n__REALTIME_TIMESTAMP=1\nTESSEL_NAME=x\n\n";
   append(file, kGood.data(), kGood.size());

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstring>
 #include <system_error>
+#include <utility>
 
 namespace tessel {
 
@@ -17,32 +18,50 @@ constexpr int kStopLatencyMilliseconds = 20;
 
 }  // namespace
 
-ByteWindow::ByteWindow(int fd, const StopFlag& stop)
-    : fd_(fd), stop_(stop), buffer_(std::make_unique_for_overwrite<char[]>(kCapacity)) {
+ByteWindow::ByteWindow(int fd, const StopFlag& stop, WindowBudget& budget)
+    : fd_(fd), stop_(stop), budget_(budget) {
+  budget_.join();
   const off_t offset = ::lseek(fd, 0, SEEK_CUR);
   seekable_ = offset >= 0;
   if (seekable_) base_ = offset;
 }
 
-ByteWindow::~ByteWindow() { ::close(fd_); }
+ByteWindow::~ByteWindow() {
+  budget_.leave();
+  ::close(fd_);
+}
 
 bool ByteWindow::fill(size_t count) {
   if (end_ - begin_ >= count) return true;
-  if (begin_ + count > kCapacity) {
-    std::memmove(buffer_.get(), buffer_.get() + begin_, end_ - begin_);
-    end_ -= begin_;
-    begin_ = 0;
-  }
+  makeRoom(count);
   while (end_ - begin_ < count) {
     if (!readMore()) return false;
   }
   return true;
 }
 
+// Brings what is held to the front of a buffer for `count` bytes, more than are held. A buffer that
+// had to be larger than its share is given back here.
+void ByteWindow::makeRoom(size_t count) {
+  const size_t wanted = std::max(count, budget_.share());
+  if (begin_ + count <= capacity_ && capacity_ <= wanted) return;
+  const size_t held = end_ - begin_;
+  if (wanted == capacity_) {
+    std::memmove(buffer_.get(), buffer_.get() + begin_, held);
+  } else {
+    auto buffer = std::make_unique_for_overwrite<char[]>(wanted);
+    if (held != 0) std::memcpy(buffer.get(), buffer_.get() + begin_, held);
+    buffer_ = std::move(buffer);
+    capacity_ = wanted;
+  }
+  begin_ = 0;
+  end_ = held;
+}
+
 bool ByteWindow::readMore() {
   for (;;) {
     if (!seekable_ && !waitForInput()) return false;
-    const ssize_t got = ::read(fd_, buffer_.get() + end_, kCapacity - end_);
+    const ssize_t got = ::read(fd_, buffer_.get() + end_, capacity_ - end_);
     if (got > 0) {
       end_ += static_cast<size_t>(got);
       return true;

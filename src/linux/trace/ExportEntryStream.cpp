@@ -11,8 +11,10 @@ namespace tessel {
 
 namespace {
 
-// A line longer than this is read in pieces.
-constexpr size_t kLongLine = ByteWindow::kCapacity / 2;
+// A line longer than this, beyond what is shown of one, is read in pieces.
+constexpr size_t kLongLine = kMaxFieldHead;
+// Memory of an entry that a stream holds on to for the next.
+constexpr size_t kUsualEntry = 1024;
 
 bool isFieldName(std::string_view name) {
   const auto valid = [](char c) {
@@ -36,9 +38,14 @@ uint64_t littleEndian(std::string_view bytes) {
 
 }  // namespace
 
-ExportEntryStream::ExportEntryStream(int fd, FieldTokenizer& tokenizer, const StopFlag& stop,
+ExportEntryStream::ExportEntryStream(int fd, ExportReadResources& resources,
+                                     FieldTokenizer& tokenizer, const StopFlag& stop,
                                      FileReport& report)
-    : window_(fd, stop), tokenizer_(tokenizer), stop_(stop), report_(report) {}
+    : resources_(resources),
+      window_(fd, stop, resources.windows),
+      tokenizer_(tokenizer),
+      stop_(stop),
+      report_(report) {}
 
 bool ExportEntryStream::next() {
   while (!stop_.load(std::memory_order_relaxed)) {
@@ -63,9 +70,16 @@ bool ExportEntryStream::next() {
 void ExportEntryStream::startEntry() {
   header_ = {};
   hasRealtime_ = false;
+  dropKept();
+  entryPlace_ = window_.place();
+}
+
+void ExportEntryStream::dropKept() {
+  resources_.bytesKept -= kept_.size() + keptFields_.size() * sizeof(KeptField);
   kept_.clear();
   keptFields_.clear();
-  entryPlace_ = window_.place();
+  if (kept_.capacity() > kUsualEntry) kept_ = {};
+  if (keptFields_.capacity() > kUsualEntry / sizeof(KeptField)) keptFields_ = {};
 }
 
 ExportEntryStream::Outcome ExportEntryStream::readEntry() {
@@ -98,9 +112,9 @@ bool ExportEntryStream::readLine(Line& line) {
   return readLongLine(line);
 }
 
-// A line that need not fit the window: its beginning is set aside.
+// A line of any length: its beginning is set aside.
 bool ExportEntryStream::readLongLine(Line& line) {
-  longHead_ = window_.bytes().substr(0, kMaxFieldHead);
+  resources_.longHead = window_.bytes().substr(0, kMaxFieldHead);
   uint64_t size = 0;
   while (!stop_.load(std::memory_order_relaxed) && window_.fill(1)) {
     const std::string_view bytes = window_.bytes();
@@ -109,7 +123,7 @@ bool ExportEntryStream::readLongLine(Line& line) {
     size += length;
     window_.consume(newline == std::string_view::npos ? length : length + 1);
     if (newline == std::string_view::npos) continue;
-    line = {longHead_, size};
+    line = {resources_.longHead, size};
     return true;
   }
   return false;
@@ -154,6 +168,11 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   if (keptFields_.size() == kMaxFieldsKept || kept_.size() + head.size() > kMaxBytesKept) {
     return bad("entry with too many fields");
   }
+  const size_t memory = head.size() + sizeof(KeptField);
+  if (resources_.bytesKept + memory > kMaxBytesKeptByAll) {
+    return bad("entry too large beside those of other files");
+  }
+  resources_.bytesKept += memory;
   keptFields_.push_back({kept_.size(), head.size(), size});
   kept_ += head;
   return Outcome::complete;
@@ -208,13 +227,13 @@ void ExportEntryStream::waitAtEntry() {
 
 Entry ExportEntryStream::entry() {
   tokenizer_.beginEntry();
-  tokens_.clear();
+  resources_.tokens.clear();
   for (const KeptField& field : keptFields_) {
     const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);
     const FieldToken token = tokenizer_.tokenFor(head, field.size);
-    if (token != kNoToken) tokens_.push_back(token);
+    if (token != kNoToken) resources_.tokens.push_back(token);
   }
-  return {header_, tokens_};
+  return {header_, resources_.tokens};
 }
 
 }  // namespace tessel

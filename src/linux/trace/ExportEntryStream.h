@@ -20,6 +20,14 @@
 
 namespace tessel {
 
+// What the export streams of one store share, to stay within a fixed amount of memory.
+struct ExportReadResources {
+  WindowBudget& windows;
+  size_t bytesKept = 0;              // of the current entries of all streams
+  std::string longHead{};            // of a line that is read in pieces
+  std::vector<FieldToken> tokens{};  // of the entry that is looked at
+};
+
 class ExportEntryStream final : public EntryStream {
  public:
   // Largest value that is believed.
@@ -27,10 +35,14 @@ class ExportEntryStream final : public EntryStream {
   // Most that is kept of one entry, of the fields that the tokenizer wants.
   static constexpr size_t kMaxFieldsKept = 1024;
   static constexpr size_t kMaxBytesKept = size_t{1024} * 1024;
+  // Most that all streams keep of their current entries, bookkeeping included.
+  static constexpr size_t kMaxBytesKeptByAll = 4 * kMaxBytesKept;
 
   // Takes the descriptor and closes it. Problems are added to `report`; its entries are not
-  // counted.
-  ExportEntryStream(int fd, FieldTokenizer& tokenizer, const StopFlag& stop, FileReport& report);
+  // counted. Whatever is passed by reference must outlive the stream.
+  ExportEntryStream(int fd, ExportReadResources& resources, FieldTokenizer& tokenizer,
+                    const StopFlag& stop, FileReport& report);
+  ~ExportEntryStream() override { dropKept(); }
 
   bool next() override;
   const EntryHeader& header() const override { return header_; }
@@ -49,6 +61,7 @@ class ExportEntryStream final : public EntryStream {
   };
 
   void startEntry();
+  void dropKept();
   Outcome readEntry();
   Outcome readField(const Line& line);
   Outcome readBinaryField(std::string_view name);
@@ -61,6 +74,7 @@ class ExportEntryStream final : public EntryStream {
   Outcome takeField(size_t nameLength, std::string_view head, uint64_t size);
   Outcome takeAddress(std::string_view name, std::string_view value);
 
+  ExportReadResources& resources_;
   ByteWindow window_;
   FieldTokenizer& tokenizer_;
   const StopFlag& stop_;
@@ -71,10 +85,8 @@ class ExportEntryStream final : public EntryStream {
   bool resynchronising_ = false;
   uint64_t entryPlace_ = 0;
   uint64_t incompletePlace_ = ~uint64_t{0};  // where an incomplete entry was counted
-  std::string longHead_;                     // of a line too long for the window
   std::string kept_;                         // heads of the wanted fields of the entry
   std::vector<KeptField> keptFields_;
-  std::vector<FieldToken> tokens_;
 };
 
 }  // namespace tessel

@@ -53,11 +53,9 @@ pid_t startJournalctl(const std::string& path, int output) {
 
 }  // namespace
 
-std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(const std::string& path,
-                                                                  uint64_t entryCount,
-                                                                  FieldTokenizer& tokenizer,
-                                                                  const StopFlag& stop,
-                                                                  FileReport& report) {
+std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
+    const std::string& path, uint64_t entryCount, ExportReadResources& resources,
+    FieldTokenizer& tokenizer, const StopFlag& stop, FileReport& report) {
   std::array<int, 2> ends{};
   if (::pipe2(ends.data(), O_CLOEXEC) != 0) return nullptr;
   UniqueFd input(ends[0]);
@@ -66,8 +64,8 @@ std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(const std::str
   if (child == 0) return nullptr;
   limit(child, RLIMIT_CPU, kProcessorSeconds);
   limit(child, RLIMIT_AS, kMemory);
-  return std::unique_ptr<ForeignJournalStream>(
-      new ForeignJournalStream(child, input.release(), entryCount, tokenizer, stop, report));
+  return std::unique_ptr<ForeignJournalStream>(new ForeignJournalStream(
+      child, input.release(), entryCount, resources, tokenizer, stop, report));
 }
 
 ForeignJournalStream::~ForeignJournalStream() {

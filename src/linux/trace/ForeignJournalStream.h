@@ -21,6 +21,7 @@ class ForeignJournalStream final : public EntryStream {
   // Starts journalctl on the file at `path`, which should hold `entryCount` entries; null where it
   // cannot be started. Problems are added to `report`.
   static std::unique_ptr<ForeignJournalStream> start(const std::string& path, uint64_t entryCount,
+                                                     ExportReadResources& resources,
                                                      FieldTokenizer& tokenizer,
                                                      const StopFlag& stop, FileReport& report);
   // Ends the child where it still runs.
@@ -31,13 +32,13 @@ class ForeignJournalStream final : public EntryStream {
   Entry entry() override { return entries_.entry(); }
 
  private:
-  ForeignJournalStream(pid_t child, int output, uint64_t entryCount, FieldTokenizer& tokenizer,
-                       const StopFlag& stop, FileReport& report)
+  ForeignJournalStream(pid_t child, int output, uint64_t entryCount, ExportReadResources& resources,
+                       FieldTokenizer& tokenizer, const StopFlag& stop, FileReport& report)
       : child_(child),
         missing_(entryCount),
         stop_(stop),
         report_(report),
-        entries_(output, tokenizer, stop, report) {}
+        entries_(output, resources, tokenizer, stop, report) {}
 
   pid_t child_;       // 0 once it was waited for
   uint64_t missing_;  // entries that the file should hold and that were not read yet

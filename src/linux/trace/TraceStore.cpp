@@ -95,6 +95,7 @@ struct TraceStore::State final : EntryStream {
   const TimeRange range;
   const StopFlag& stop;
   JournalReadResources resources;
+  ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
   StoreReport facts;  // its files are complete before the first stream is made
   size_t usableFiles = 0;
@@ -140,7 +141,7 @@ std::unique_ptr<EntryStream> TraceStore::State::openFile(StoreFile& file, uint32
   }
   if (file.kind == StoreFileKind::exportStream) {
     ++usableFiles;
-    return std::make_unique<ExportEntryStream>(file.fd.release(), tokenizer, stop, report);
+    return std::make_unique<ExportEntryStream>(file.fd.release(), exports, tokenizer, stop, report);
   }
   return openJournal(file, number);
 }
@@ -154,8 +155,8 @@ std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uin
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
-    auto foreign = ForeignJournalStream::start(file.path, plausibleEntries(header, size), tokenizer,
-                                               stop, report);
+    auto foreign = ForeignJournalStream::start(file.path, plausibleEntries(header, size), exports,
+                                               tokenizer, stop, report);
     if (!foreign) report.skipped = "written with features that are not known";
     usableFiles += foreign != nullptr;
     return foreign;

@@ -2,6 +2,7 @@
 
 #include "linux/trace/ExportEntryStream.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
@@ -39,11 +40,13 @@ std::string binary(std::string_view name, std::string_view value,
   return field + std::string(value) + "\n";
 }
 
-class ExportEntryStreamTest : public ::testing::Test {
+// Alone, and beside so many other files that the window is as small as it gets.
+class ExportEntryStreamTest : public ::testing::TestWithParam<size_t> {
  protected:
   ExportEntryStreamTest()
-      : file_(::memfd_create("export", 0)), stream_(::dup(file_), tokenizer_, stop, report) {
-    append({});
+      : file_(::memfd_create("export", 0)),
+        stream_(::dup(file_), resources_, tokenizer_, stop, report) {
+    for (size_t i = 0; i < GetParam(); ++i) windows_.join();
   }
   ~ExportEntryStreamTest() override { ::close(file_); }
 
@@ -79,14 +82,18 @@ class ExportEntryStreamTest : public ::testing::Test {
 
  private:
   RecordingTokenizer tokenizer_;
+  WindowBudget windows_;
+  ExportReadResources resources_{windows_};
   int file_;
   off_t size_ = 0;
   ExportEntryStream stream_;
 };
 
+INSTANTIATE_TEST_SUITE_P(OtherFiles, ExportEntryStreamTest, ::testing::Values(0, 20'000));
+
 constexpr std::string_view kGood = "__REALTIME_TIMESTAMP=7\nT=good\n\n";
 
-TEST_F(ExportEntryStreamTest, readsBothFormsOfAField) {
+TEST_P(ExportEntryStreamTest, readsBothFormsOfAField) {
   append("__REALTIME_TIMESTAMP=5\nT=a=b\nMESSAGE=x\n");
   append(binary("T", "two\nlines\n\n") + binary("MESSAGE", "\n\n") + binary("T", "") + "\n\n\n");
   append(kGood);
@@ -94,7 +101,7 @@ TEST_F(ExportEntryStreamTest, readsBothFormsOfAField) {
   EXPECT_THAT(problems(), IsEmpty());
 }
 
-TEST_F(ExportEntryStreamTest, readsWhereAnEntryStands) {
+TEST_P(ExportEntryStreamTest, readsWhereAnEntryStands) {
   append(
       "__CURSOR=s=000102030405060708090a0b0c0d0e0f;i=a1;b=ffffffffffffffffffffffffffffffff;m=2;t=3;"
       "x=4\n"
@@ -111,7 +118,7 @@ TEST_F(ExportEntryStreamTest, readsWhereAnEntryStands) {
   EXPECT_EQ(header().bootId, Id128{});
 }
 
-TEST_F(ExportEntryStreamTest, showsOnlyTheHeadOfALongValue) {
+TEST_P(ExportEntryStreamTest, showsOnlyTheHeadOfALongValue) {
   const std::string longValue(300'000, 'x');
   append("__REALTIME_TIMESTAMP=1\nT=" + longValue + "\n" + binary("T", longValue) +
          "MESSAGE=" + longValue + "\n\n");
@@ -119,7 +126,7 @@ TEST_F(ExportEntryStreamTest, showsOnlyTheHeadOfALongValue) {
   EXPECT_THAT(readAll(), ElementsAre("1: T=xxxx/300002 T=xxxx/300002", "7: T=good"));
 }
 
-TEST_F(ExportEntryStreamTest, goesOnAfterBadData) {
+TEST_P(ExportEntryStreamTest, goesOnAfterBadData) {
   const std::string time = "__REALTIME_TIMESTAMP=1\n";
   const struct {
     std::string text;
@@ -148,7 +155,7 @@ TEST_F(ExportEntryStreamTest, goesOnAfterBadData) {
   }
 }
 
-TEST_F(ExportEntryStreamTest, anEntryWithTooMuchInItIsBad) {
+TEST_P(ExportEntryStreamTest, anEntryWithTooMuchInItIsBad) {
   std::string text = "__REALTIME_TIMESTAMP=1\n";
   for (size_t i = 0; i <= ExportEntryStream::kMaxFieldsKept; ++i) text += "T=x\n";
   append(text + "\n");
@@ -157,7 +164,7 @@ TEST_F(ExportEntryStreamTest, anEntryWithTooMuchInItIsBad) {
   EXPECT_THAT(problems(), ElementsAre("entry with too many fields at 0 x1"));
 }
 
-TEST_F(ExportEntryStreamTest, anEntryIsThereWithItsEmptyLine) {
+TEST_P(ExportEntryStreamTest, anEntryIsThereWithItsEmptyLine) {
   const std::string entry = "__REALTIME_TIMESTAMP=3\n" + binary("T", "a\n\nb") + "T=c\n\n";
   for (const char& byte : entry) {
     EXPECT_THAT(readAll(), IsEmpty());
@@ -170,7 +177,7 @@ TEST_F(ExportEntryStreamTest, anEntryIsThereWithItsEmptyLine) {
   EXPECT_THAT(problems(), ElementsAre("incomplete last entry at 0 x2"));
 }
 
-TEST_F(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
+TEST_P(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
   const std::string start =
       "__REALTIME_TIMESTAMP=3\nT=first\n" + binary("MESSAGE", std::string(400'000, 'm'));
   append(start);
@@ -179,7 +186,7 @@ TEST_F(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
   EXPECT_THAT(readAll(), ElementsAre("3: T=first"));
 }
 
-TEST_F(ExportEntryStreamTest, badDataThatIsNotOverYetIsCountedOnce) {
+TEST_P(ExportEntryStreamTest, badDataThatIsNotOverYetIsCountedOnce) {
   append("garbage\nmore");
   EXPECT_THAT(readAll(), IsEmpty());
   append(" garbage\n\n");
@@ -188,13 +195,39 @@ TEST_F(ExportEntryStreamTest, badDataThatIsNotOverYetIsCountedOnce) {
   EXPECT_THAT(problems(), ElementsAre("line that is no field at 0 x1"));
 }
 
-TEST_F(ExportEntryStreamTest, aStopEndsIt) {
+TEST_P(ExportEntryStreamTest, aStopEndsIt) {
   append(kGood);
   append(kGood);
   ASSERT_TRUE(next());
   stop = true;
   EXPECT_FALSE(next());
   EXPECT_THAT(problems(), IsEmpty());
+}
+
+TEST(ExportResourcesTest, whatAllStreamsKeepIsBounded) {
+  const int file = ::memfd_create("large", 0);
+  std::string text = "__REALTIME_TIMESTAMP=1\n";
+  for (int i = 0; i < 250; ++i) text += "T=" + std::string(4000, 'x') + "\n";
+  ASSERT_EQ(::write(file, (text + "\n").data(), text.size() + 1), ssize_t(text.size() + 1));
+  const std::string path = "/proc/self/fd/" + std::to_string(file);
+  RecordingTokenizer tokenizer;
+  StopFlag stop = false;
+  FileReport report;
+  WindowBudget windows;
+  ExportReadResources resources{windows};
+  std::vector<std::unique_ptr<ExportEntryStream>> streams;
+  size_t kept = 0;
+  for (int i = 0; i < 20; ++i) {
+    streams.push_back(std::make_unique<ExportEntryStream>(::open(path.c_str(), O_RDONLY), resources,
+                                                          tokenizer, stop, report));
+    kept += streams.back()->next();
+    EXPECT_LE(resources.bytesKept, ExportEntryStream::kMaxBytesKeptByAll);
+  }
+  EXPECT_EQ(kept, 4u);
+  EXPECT_EQ(report.problems.at(0).count, 16u);
+  streams.clear();
+  EXPECT_EQ(resources.bytesKept, 0u);
+  ::close(file);
 }
 
 TEST(ExportPipeTest, aPipeIsReadToItsEnd) {
@@ -206,7 +239,9 @@ TEST(ExportPipeTest, aPipeIsReadToItsEnd) {
   RecordingTokenizer tokenizer;
   StopFlag stop = false;
   FileReport report;
-  ExportEntryStream stream(ends[0], tokenizer, stop, report);
+  WindowBudget windows;
+  ExportReadResources resources{windows};
+  ExportEntryStream stream(ends[0], resources, tokenizer, stop, report);
   EXPECT_TRUE(stream.next());
   EXPECT_FALSE(stream.next());
   ASSERT_EQ(report.problems.size(), 1u);

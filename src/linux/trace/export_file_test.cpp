@@ -34,7 +34,9 @@ class ExportFileTest : public ::testing::Test {
     std::vector<std::string> all;
     TracePointTable table;
     StopFlag stop = false;
-    ExportEntryStream stream(::open(path().c_str(), O_RDONLY), table, stop, report);
+    WindowBudget windows;
+    ExportReadResources resources{windows};
+    ExportEntryStream stream(::open(path().c_str(), O_RDONLY), resources, table, stop, report);
     uint64_t expected = 1;
     while (stream.next()) {
       const Entry entry = stream.entry();

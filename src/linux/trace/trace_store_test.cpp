@@ -242,7 +242,9 @@ TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
   FileReport report;
-  const auto stream = ForeignJournalStream::start(path, 100, tokenizer, stop, report);
+  WindowBudget windows;
+  ExportReadResources resources{windows};
+  const auto stream = ForeignJournalStream::start(path, 100, resources, tokenizer, stop, report);
   ASSERT_NE(stream, nullptr);
   EXPECT_EQ(testing::readAll(*stream, tokenizer).size(), 100u);
   EXPECT_TRUE(report.problems.empty());
