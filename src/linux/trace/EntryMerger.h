@@ -2,8 +2,8 @@
 //
 // Of two entries, the one with the lower number comes first where both count in the same sequence,
 // else the earlier by the monotonic clock where both are of one boot, else the earlier by the wall
-// clock. An entry that stands in several streams is delivered once; equal entries of one stream are
-// all delivered.
+// clock. An entry that stands in several streams is delivered once, where that order does not run
+// in a circle; equal entries of one stream are all delivered.
 //
 // Threads: one at a time, but for the stop flag.
 
@@ -27,11 +27,12 @@ bool sameEntry(const EntryHeader& a, const EntryHeader& b);
 
 class EntryMerger final : public EntryStream {
  public:
-  // `stop` must outlive the merger.
-  explicit EntryMerger(const StopFlag& stop) : stop_(stop) {}
+  // Adds to `duplicates` the entries that it leaves out as they stand in another stream as well.
+  // Both must outlive the merger.
+  EntryMerger(const StopFlag& stop, uint64_t& duplicates) : stop_(stop), duplicates_(duplicates) {}
 
   // Adds a stream; it is asked for its first entry at once, and closed after its last.
-  // REQUIRES: next() was not called.
+  // REQUIRES: next() was not called; the stream's header() is one object for all entries.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
   bool next() override;
@@ -39,8 +40,6 @@ class EntryMerger final : public EntryStream {
   Entry entry() override { return heap_.front().stream->entry(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
   uint32_t streamNumber() const { return heap_.front().number; }
-  // Entries left out as they stand in another stream as well.
-  uint64_t duplicates() const { return duplicates_; }
 
  private:
   struct Source {
@@ -55,10 +54,10 @@ class EntryMerger final : public EntryStream {
   void dropDuplicates();
 
   const StopFlag& stop_;
+  uint64_t& duplicates_;
   std::vector<Source> heap_;
   bool started_ = false;
   uint64_t current_ = 0;  // entries delivered, the current one included
-  uint64_t duplicates_ = 0;
 };
 
 }  // namespace tessel

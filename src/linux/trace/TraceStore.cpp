@@ -4,12 +4,12 @@
 #include <utility>
 #include <vector>
 
-#include "linux/trace/EntryMerger.h"
 #include "linux/trace/ExportEntryStream.h"
 #include "linux/trace/ForeignJournalStream.h"
 #include "linux/trace/JournalEntryStream.h"
 #include "linux/trace/LossTokenizer.h"
 #include "linux/trace/StoreFiles.h"
+#include "linux/trace/StoreMerger.h"
 
 namespace tessel {
 
@@ -66,6 +66,9 @@ void SequenceWatch::change(const EntryHeader& entry) {
   }
 }
 
+// Of a stream whose entries may count in any sequence.
+constexpr Id128 kNoSequence{};
+
 // What the header says of a file whose layout is not known, as far as the file can hold it.
 uint64_t plausibleEntries(const JournalHeader& header, uint64_t size) {
   return std::min(header.entryCount, size / journal_format::kEntryItemsAt);
@@ -84,8 +87,8 @@ struct TraceStore::State final : EntryStream {
   Entry entry() override;
 
   void openFiles(StoreFiles found);
-  std::unique_ptr<EntryStream> openFile(StoreFile& file, uint32_t number);
-  std::unique_ptr<EntryStream> openJournal(StoreFile& file, uint32_t number);
+  void openFile(StoreFile& file, uint32_t number);
+  void openJournal(StoreFile& file, uint32_t number);
   bool outsideRange(const JournalHeader& header) const;
   std::optional<PlatformError> failure(const std::string& place) const;
   void seeTime(uint64_t realtime) {
@@ -100,7 +103,7 @@ struct TraceStore::State final : EntryStream {
   StoreReport facts;  // its files are complete before the first stream is made
   size_t usableFiles = 0;
   SequenceWatch sequences;
-  EntryMerger merger;
+  StoreMerger merger;
 };
 
 bool TraceStore::State::next() {
@@ -121,56 +124,61 @@ Entry TraceStore::State::entry() {
   return {whole.header, tokenizer.takeOwn(whole.tokens)};
 }
 
-// All streams are made before the first is read, so that each knows its share of the memory.
 void TraceStore::State::openFiles(StoreFiles found) {
   facts.filesNotLookedAt = found.leftOut;
   facts.files.resize(found.files.size());
-  std::vector<std::pair<std::unique_ptr<EntryStream>, uint32_t>> streams;
   for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
     facts.files[i].path = found.files[i].path;
-    if (auto stream = openFile(found.files[i], i)) streams.emplace_back(std::move(stream), i);
+    openFile(found.files[i], i);
   }
-  for (auto& [stream, number] : streams) merger.add(std::move(stream), number);
 }
 
-std::unique_ptr<EntryStream> TraceStore::State::openFile(StoreFile& file, uint32_t number) {
+void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   if (!file.fd.valid()) {
     report.skipped = whyNotOpened(file.error);
-    return nullptr;
+    return;
   }
   if (file.kind == StoreFileKind::exportStream) {
     ++usableFiles;
-    return std::make_unique<ExportEntryStream>(file.fd.release(), exports, tokenizer, stop, report);
+    merger.add(
+        std::make_unique<ExportEntryStream>(file.fd.release(), exports, tokenizer, stop, report),
+        number, kNoSequence);
+  } else {
+    openJournal(file, number);
   }
-  return openJournal(file, number);
 }
 
-std::unique_ptr<EntryStream> TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
+void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   auto opened = readJournalHeader(file.fd.get());
   if (auto* reason = std::get_if<std::string>(&opened)) {
     report.skipped = std::move(*reason);
-    return nullptr;
+    return;
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
     auto foreign = ForeignJournalStream::start(file.path, plausibleEntries(header, size), exports,
                                                tokenizer, stop, report);
-    if (!foreign) report.skipped = "written with features that are not known";
-    usableFiles += foreign != nullptr;
-    return foreign;
+    if (!foreign) {
+      report.skipped = "written with features that are not known";
+      return;
+    }
+    ++usableFiles;
+    merger.add(std::move(foreign), number, kNoSequence);
+    return;
   }
   ++usableFiles;
   if (header.headRealtime != 0) seeTime(header.headRealtime);
   if (outsideRange(header)) {
     report.skipped = "outside the range";
     report.outsideRange = true;
-    return nullptr;
+    return;
   }
-  return std::make_unique<JournalEntryStream>(
-      std::move(file.fd), size, header, number,
-      JournalEntryStream::Context{resources, tokenizer, stop, report});
+  merger.add(std::make_unique<JournalEntryStream>(
+                 std::move(file.fd), size, header, number,
+                 JournalEntryStream::Context{resources, tokenizer, stop, report}),
+             number, header.sequenceId);
 }
 
 // A clock that was set back within the file shows where its ends stand the wrong way round.

@@ -6,8 +6,11 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <filesystem>
+#include <map>
+#include <random>
 
 #include "linux/testing/TemporaryDirectory.h"
 #include "linux/trace/ForeignJournalStream.h"
@@ -149,6 +152,42 @@ TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
   EXPECT_EQ(reading.entries.size(), 32u);
   EXPECT_EQ(reading.report.entriesRead, 32u);
   EXPECT_EQ(reading.report.duplicateEntries, 15u);
+}
+
+// Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
+// all of them.
+TEST(TraceStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
+  constexpr size_t kEntries = 60;
+  for (unsigned seed = 0; seed < 50; ++seed) {
+    std::mt19937 random(seed);
+    const TemporaryDirectory directory;
+    for (uint8_t sequence = 1; sequence <= 4; ++sequence) {
+      JournalWriter writer({.sequenceId = {sequence}});
+      EntryHeader header;
+      for (size_t i = 0; i < kEntries; ++i) {
+        if (i % 20 == 0) header.bootId = {static_cast<uint8_t>(random() % 3)};
+        if (i % 20 == 0) header.monotonic = 1 + random() % 50;
+        if (i % 15 == 0) header.realtime = 1000 + random() % 50;
+        header.monotonic += 1 + random() % 3;
+        header.realtime += 1 + random() % 3;
+        writer.add(header, {"MESSAGE=" + std::to_string(random())});
+        // A copy from when the file was not yet as long, and one of all of it.
+        if (i % 30 == 29)
+          directory.write(std::to_string(sequence) + (i > 30 ? "" : "early") + ".journal",
+                          writer.bytes());
+      }
+      directory.write(std::to_string(sequence) + "copy.journal", writer.bytes());
+    }
+    const Reading reading = readStore(directory.path());
+    std::map<Id128, std::vector<uint64_t>> numbers;
+    for (const PlainEntry& entry : reading.entries)
+      numbers[entry.header.sequenceId].push_back(entry.header.sequenceNumber);
+    EXPECT_EQ(reading.entries.size(), 4 * kEntries) << seed;
+    EXPECT_EQ(reading.report.duplicateEntries, 4 * (kEntries + 30)) << seed;
+    EXPECT_EQ(reading.report.missingEntries, 0u) << seed;
+    for (const auto& [sequence, all] : numbers)
+      EXPECT_TRUE(std::is_sorted(all.begin(), all.end())) << seed;
+  }
 }
 
 TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
