@@ -8,7 +8,7 @@ constexpr uint32_t kFirstSequence = 0x80000000;
 
 class StoreMerger::Sequence final : public EntryStream {
  public:
-  Sequence(const StopFlag& stop, uint64_t& duplicates, Streams streams)
+  Sequence(const StopFlag& stop, uint64_t& duplicates, Streams& streams)
       : merger_(stop, duplicates) {
     for (auto& [stream, number] : streams) merger_.add(std::move(stream), number);
   }
@@ -39,16 +39,16 @@ bool StoreMerger::next() {
 void StoreMerger::start() {
   for (auto& [sequence, streams] : std::exchange(waiting_, {})) {
     if (sequence != Id128{} && streams.size() > 1) {
-      addSequence(std::move(streams));
+      addSequence(streams);
     } else {
       for (auto& [stream, number] : streams) all_.add(std::move(stream), number);
     }
   }
 }
 
-void StoreMerger::addSequence(Streams streams) {
+void StoreMerger::addSequence(Streams& streams) {
   const auto number = kFirstSequence + static_cast<uint32_t>(sequences_.size());
-  auto sequence = std::make_unique<Sequence>(stop_, duplicates_, std::move(streams));
+  auto sequence = std::make_unique<Sequence>(stop_, duplicates_, streams);
   sequences_.push_back(sequence.get());
   all_.add(std::move(sequence), number);
 }

@@ -41,7 +41,7 @@ class StoreMerger final : public EntryStream {
   class Sequence;
 
   void start();
-  void addSequence(Streams streams);
+  void addSequence(Streams& streams);
 
   const StopFlag& stop_;
   uint64_t duplicates_ = 0;

@@ -226,6 +226,19 @@ TEST_F(JournalMeanwhileTest, AFileThatIsCutLosesWhatWasCutAndThatIsTold) {
   }
 }
 
+TEST_F(JournalMeanwhileTest, AFileThatTheDaemonClosesLosesItsUnusedEndAndNothingIsToldOfIt) {
+  for (const uint8_t state : {kOnline, kArchived}) {
+    std::string file = journalOf(kEntries, {.state = state}).bytes();
+    const size_t used = file.size();
+    file.resize(used + (size_t{1} << 20));
+    put(file, kArenaSizeAt, file.size() - 256);
+    directory_.write("a.journal", file);
+    const Outcome outcome = read(path_, 1, [&] { std::filesystem::resize_file(path_, used); });
+    EXPECT_EQ(outcome.numbers.size(), kEntries);
+    EXPECT_FALSE(outcome.problemTold);
+  }
+}
+
 TEST_F(JournalMeanwhileTest, AFileThatIsPunchedLosesWhatWasPunchedAndThatIsTold) {
   constexpr size_t kHole = 64 << 10;
   std::mt19937 random(1);
