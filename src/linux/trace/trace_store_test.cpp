@@ -1,4 +1,5 @@
-// Journals of every layout, read side by side with libsystemd.
+// Stores of files of every kind. What the journal's own tools write is read beside libsystemd and
+// journalctl in tests/reading.
 
 #include "linux/trace/TraceStore.h"
 
@@ -7,7 +8,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <filesystem>
 #include <map>
 #include <random>
@@ -58,51 +58,6 @@ std::string someJournal(size_t count, uint64_t firstSequence = 1, JournalLayout 
   return writer.bytes();
 }
 
-// What journal-remote is fed: boots, binary and repeated fields, values large enough to compress.
-std::string exportText(int entries, uint64_t firstMicrosecond, int boots) {
-  std::string text;
-  for (int i = 0; i < entries; ++i) {
-    const std::string number = std::to_string(i);
-    text += "__REALTIME_TIMESTAMP=" +
-            std::to_string(firstMicrosecond + static_cast<uint64_t>(i) * 1000) +
-            "\n__MONOTONIC_TIMESTAMP=" + std::to_string(1000 + i * 1000 / boots) +
-            "\n_BOOT_ID=0123456789abcdef0123456789abcde" + std::to_string(i * boots / entries) +
-            "\nMESSAGE=message " + number + "\n_PID=" + std::to_string(i % 50) + "\nPRIORITY=6\n";
-    if (i % 7 == 0) text += "LARGE=" + std::string(3000 + i % 3000, 'x') + number + "\n";
-    if (i % 9 == 0) text += "TESSEL_ATTRIBUTE=a=" + number + "\nTESSEL_ATTRIBUTE=b=\n";
-    if (i % 11 == 0) text += std::string("BINARY\n\x07\0\0\0\0\0\0\0a\nb\0\n\n\xff\n", 23);
-    text += "\n";
-  }
-  return text;
-}
-
-void makeWithJournalRemote(const std::string& path, const std::string& text, bool compact,
-                           bool keyedHash) {
-  const std::string command = std::string("SYSTEMD_JOURNAL_COMPACT=") + (compact ? "1" : "0") +
-                              " SYSTEMD_JOURNAL_KEYED_HASH=" + (keyedHash ? "1" : "0") +
-                              " /lib/systemd/systemd-journal-remote --compress=yes -o '" + path +
-                              "' - >/dev/null 2>&1";
-  FILE* pipe = ::popen(command.c_str(), "w");
-  ASSERT_NE(pipe, nullptr);
-  std::fwrite(text.data(), 1, text.size(), pipe);
-  ASSERT_EQ(::pclose(pipe), 0);
-}
-
-TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInEveryLayoutOfTheDaemon) {
-  const TemporaryDirectory directory;
-  for (const bool compact : {false, true}) {
-    for (const bool keyedHash : {false, true}) {
-      const std::string path = directory.path("one.journal");
-      makeWithJournalRemote(path, exportText(3000, 1'795'300'000'000'000, 3), compact, keyedHash);
-      const Reading reading = readStore(path);
-      EXPECT_EQ(reading.entries.size(), 3000u);
-      EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({path})) << compact << keyedHash;
-      EXPECT_TRUE(reading.report.files.at(0).problems.empty());
-      std::filesystem::remove(path);
-    }
-  }
-}
-
 TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
   using namespace journal_format;
   const JournalLayout layouts[] = {
@@ -126,17 +81,6 @@ TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
     EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({path})) << number;
     EXPECT_TRUE(reading.report.files.at(0).problems.empty()) << number;
   }
-}
-
-TEST(TraceStoreTest, MergesOverlappingFilesAsLibsystemdDoes) {
-  const TemporaryDirectory directory;
-  const std::string a = directory.path("a.journal"), b = directory.path("sub/b.journal");
-  std::filesystem::create_directory(directory.path("sub"));
-  makeWithJournalRemote(a, exportText(1000, 1'795'300'000'000'000, 1), true, true);
-  makeWithJournalRemote(b, exportText(1000, 1'795'300'000'333'000, 1), false, false);
-  const Reading reading = readStore(directory.path());
-  EXPECT_EQ(reading.entries.size(), 2000u);
-  EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({a, b}));
 }
 
 TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {

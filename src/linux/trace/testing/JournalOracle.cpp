@@ -1,10 +1,16 @@
 #include "linux/trace/testing/JournalOracle.h"
 
 #include <systemd/sd-journal.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <ostream>
+
+#include "linux/trace/EntryCursor.h"
+#include "linux/trace/ExportEntryStream.h"
 
 namespace tessel::testing {
 
@@ -72,6 +78,27 @@ std::vector<PlainEntry> readWithLibsystemd(const std::vector<std::string>& files
   std::vector<PlainEntry> entries;
   SD_JOURNAL_FOREACH(journal) entries.push_back(currentEntry(journal));
   sd_journal_close(journal);
+  return entries;
+}
+
+std::vector<PlainEntry> readWithJournalctl(const std::string& path) {
+  const std::string place =
+      (std::filesystem::is_directory(path) ? "--directory=" : "--file=") + path;
+  FILE* pipe = ::popen(("journalctl --quiet --all --output=export '" + place + "'").c_str(), "r");
+  if (pipe == nullptr) std::abort();
+  RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  FileReport report;
+  WindowBudget windows;
+  ExportReadResources resources{windows};
+  ExportEntryStream stream(::dup(::fileno(pipe)), resources, tokenizer, stop, report);
+  std::vector<PlainEntry> entries = readAll(stream, tokenizer);
+  if (::pclose(pipe) != 0 || !report.problems.empty()) entries.clear();
+  // The format has the boot among what says where an entry stands.
+  for (PlainEntry& entry : entries) {
+    entry.fields.push_back("_BOOT_ID=" + textOf(entry.header.bootId));
+    std::sort(entry.fields.begin(), entry.fields.end());
+  }
   return entries;
 }
 

@@ -45,4 +45,7 @@ std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& t
 // All entries of `files`, merged by libsystemd. Its entries have no content hash and no sequence.
 std::vector<PlainEntry> readWithLibsystemd(const std::vector<std::string>& files);
 
+// All entries of the directory or file `path` as `journalctl -o export` prints them.
+std::vector<PlainEntry> readWithJournalctl(const std::string& path);
+
 }  // namespace tessel::testing

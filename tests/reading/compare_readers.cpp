@@ -1,0 +1,120 @@
+// compare_readers [--ours|--stop-after MILLISECONDS] PATH
+//
+// Reads the journals at PATH, a directory or a file, with our reader, with libsystemd and with
+// `journalctl -o export`, and compares entry by entry. Prints a line of figures for our reader, one
+// for each file that it says something about, and one for each other reader that saw something
+// else; ends with 1 in that last case. --ours reads with ours alone; --stop-after asks it to stop
+// meanwhile and prints how long that took.
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdlib>
+#include <iostream>
+#include <set>
+#include <string_view>
+#include <thread>
+
+#include "linux/trace/EntryCursor.h"
+#include "linux/trace/TraceStore.h"
+#include "linux/trace/testing/JournalOracle.h"
+
+namespace {
+
+using namespace tessel;
+using testing::PlainEntry;
+using Clock = std::chrono::steady_clock;
+
+void printReport(const StoreReport& report) {
+  for (const FileReport& file : report.files) {
+    if (file.skipped) std::cout << "skipped " << file.path << ": " << *file.skipped << "\n";
+    for (const FileProblem& problem : file.problems)
+      std::cout << "problem " << file.path << ": " << problem.reason << " x" << problem.count
+                << "\n";
+  }
+}
+
+// The rest of a stream; its fields are looked at and forgotten.
+std::vector<PlainEntry> readHeaders(EntryStream& stream) {
+  std::vector<PlainEntry> entries;
+  while (stream.next()) entries.push_back({stream.entry().header, {}});
+  return entries;
+}
+
+// Entries that were delivered more than once.
+size_t repeated(const std::vector<PlainEntry>& entries) {
+  std::set<std::string> seen;
+  for (const PlainEntry& entry : entries) seen.insert(cursorOf(entry.header));
+  return entries.size() - seen.size();
+}
+
+bool same(std::string_view name, const std::vector<PlainEntry>& ours,
+          const std::vector<PlainEntry>& theirs) {
+  // libsystemd does not tell sequence and hash.
+  const auto equal = [](const PlainEntry& a, const PlainEntry& b) {
+    return a == b && (b.header.sequenceNumber == 0 || cursorOf(a.header) == cursorOf(b.header));
+  };
+  const auto [mine, other] =
+      std::mismatch(ours.begin(), ours.end(), theirs.begin(), theirs.end(), equal);
+  if (mine == ours.end() && other == theirs.end()) return true;
+  std::cout << name << " sees " << theirs.size() << " entries, other ones from number "
+            << mine - ours.begin() << " on; ours:";
+  if (mine != ours.end()) std::cout << *mine;
+  std::cout << "\nthe other:";
+  if (other != theirs.end()) std::cout << *other;
+  std::cout << "\n";
+  return false;
+}
+
+int compare(const std::string& path, bool withOthers) {
+  testing::RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  if (const auto* error = std::get_if<PlatformError>(&opened)) {
+    std::cout << error->localizedDescription << "\n";
+    return 2;
+  }
+  TraceStore& store = *std::get<0>(opened);
+  const std::vector<PlainEntry> ours =
+      withOthers ? testing::readAll(store.entries(), tokenizer) : readHeaders(store.entries());
+  const StoreReport report = store.report();
+  std::cout << "entries " << ours.size() << " repeated " << repeated(ours) << " duplicates "
+            << report.duplicateEntries << " files " << report.files.size() << "\n";
+  printReport(report);
+  if (!withOthers) return 0;
+  std::vector<std::string> files;
+  for (const FileReport& file : report.files) files.push_back(file.path);
+  const bool libsystemd = same("libsystemd", ours, testing::readWithLibsystemd(files));
+  return same("journalctl", ours, testing::readWithJournalctl(path)) && libsystemd ? 0 : 1;
+}
+
+int stopMeanwhile(const std::string& path, std::chrono::milliseconds after) {
+  testing::RecordingTokenizer tokenizer;
+  StopFlag stop{false};
+  Clock::time_point stopped{};
+  std::thread stopper([&] {
+    std::this_thread::sleep_for(after);
+    stopped = Clock::now();
+    stop = true;
+  });
+  size_t entries = 0;
+  {
+    auto opened = TraceStore::open(path, {}, tokenizer, stop);
+    if (auto* store = std::get_if<0>(&opened))
+      for (; (*store)->entries().next(); ++entries) (*store)->entries().entry();
+  }
+  const auto ended = Clock::now();
+  stopper.join();
+  const std::chrono::duration<double, std::milli> latency = ended - stopped;
+  std::cout << "entries " << entries << " latency " << latency.count() << " ms\n";
+  return 0;
+}
+
+}  // namespace
+
+int main(int count, char** words) {
+  const std::string_view mode = count > 2 ? words[1] : "";
+  if (count == 4 && mode == "--stop-after")
+    return stopMeanwhile(words[3], std::chrono::milliseconds(std::atoi(words[2])));
+  return count < 2 ? 2 : compare(words[count - 1], mode != "--ours");
+}

@@ -1,0 +1,229 @@
+#!/usr/bin/env python3
+"""Our journal reader beside libsystemd and journalctl, on what the journal's own tools write.
+
+Runs beside a live daemon (see with-journald). TESSEL_RECOVERY_MB=100 makes the damaged files as large
+as they are before a release.
+"""
+
+import argparse
+import itertools
+import os
+import random
+import re
+import shutil
+import signal
+import socket
+import struct
+import subprocess
+import tempfile
+import threading
+import time
+import unittest
+
+OPTIONS = None
+RECOVERY_MB = int(os.environ.get("TESSEL_RECOVERY_MB", "8"))
+LIVE = "/var/log/journal"
+START = 1_795_300_000_000_000
+
+
+def exported(count, source=0, boots=1, start=START, clock=lambda index: 0):
+    """Entries in the Journal Export Format a millisecond apart, with repeated, binary and large fields."""
+    text, rng = [], random.Random(source)
+    for index in range(count):
+        boot = index * boots // count
+        text.append(f"__REALTIME_TIMESTAMP={start + index * 1000 + clock(index)}\n"
+                    f"__MONOTONIC_TIMESTAMP={start % 10**9 + (index - boot * count // boots) * 1000}\n"
+                    f"_BOOT_ID={boot:032x}\nMESSAGE=message {source} {index}\n_PID={index % 50}\nPRIORITY=6\n".encode())
+        if index % 7 == 0:
+            text.append(b"LARGE=" + rng.randbytes(20).hex().encode() * (50 + index % 150) + b"\n")
+        if index % 9 == 0:
+            text.append(f"TESSEL_ATTRIBUTE=a={index}\nTESSEL_ATTRIBUTE=b=\n".encode())
+        if index % 11 == 0:
+            text.append(b"BINARY\n\x07\0\0\0\0\0\0\0a\nb\0\n\n\xff\n")
+        text.append(b"\n")
+    return b"".join(text)
+
+
+def read(path, *mode, **options):
+    """What compare_readers says, its exit status and the figures of its first line."""
+    result = subprocess.run([OPTIONS.compare, *mode, path], capture_output=True, text=True, errors="replace",
+                            timeout=300, check=False, **options)
+    result.figures = {name: int(value) for name, value in re.findall(r"(\w+) (\d+)", result.stdout.split("\n")[0])}
+    return result
+
+
+class ReadingTest(unittest.TestCase):
+    def setUp(self):
+        folder = tempfile.TemporaryDirectory()
+        self.addCleanup(folder.cleanup)
+        self.folder = folder.name
+        os.chmod(self.folder, 0o755)
+
+    def make(self, name, text, compact=True, keyed=True, compress=True):
+        path = os.path.join(self.folder, name)
+        environment = {**os.environ, "SYSTEMD_JOURNAL_COMPACT": str(int(compact)),
+                       "SYSTEMD_JOURNAL_KEYED_HASH": str(int(keyed))}
+        subprocess.run(["/lib/systemd/systemd-journal-remote", f"--compress={compress}", "-o", path, "-"], input=text,
+                       env=environment, capture_output=True, check=True)
+        return path
+
+    def assert_all_agree(self, path, **figures):
+        result = read(path)
+        self.assertEqual(result.returncode, 0, result.stdout)
+        self.assertEqual(result.stdout.count("\n"), 1, result.stdout)
+        self.assertEqual(result.figures, {**result.figures, **figures, "repeated": 0})
+        return result.figures
+
+
+class Files(ReadingTest):
+    def test_every_layout_boots_and_a_clock_set_back(self):
+        text = exported(2000, boots=3, clock=lambda index: -800_000 if index > 300 else 0)
+        for compact, keyed, compress in itertools.product((False, True), repeat=3):
+            with self.subTest(compact=compact, keyed=keyed, compress=compress):
+                self.assert_all_agree(self.make("a.journal", text, compact, keyed, compress), entries=2000)
+                os.unlink(os.path.join(self.folder, "a.journal"))
+
+    def test_several_sources_and_files_that_overlap(self):
+        first = self.make("a.journal", exported(1000))
+        shutil.copy(first, os.path.join(self.folder, "copy.journal"))
+        self.make("a.journal", exported(500, start=START + 10**6))
+        self.make("b.journal", exported(1500, source=1, start=START + 333), compact=False)
+        archived = self.make("c.journal", exported(700, source=2, start=START + 500_000), keyed=False)
+        os.rename(archived, archived + "~")
+        self.assert_all_agree(self.folder, entries=3700, duplicates=1000, files=4)
+
+    def test_a_file_that_may_not_be_read_is_named_and_the_others_are_read(self):
+        hidden = self.make("a.journal", exported(10))
+        os.chmod(hidden, 0o600)
+        os.chmod(self.make("b.journal", exported(10, source=1)), 0o644)
+        result = read(self.folder, "--ours", user=65534, group=65534, extra_groups=[])
+        self.assertEqual(result.figures["entries"], 10)
+        self.assertIn(f"skipped {hidden}: Permission denied", result.stdout)
+
+
+class Recovery(ReadingTest):
+    """Of a large file, all that is still there comes back."""
+
+    def word(self, place):
+        return struct.unpack_from("<Q", self.journal, place)[0]
+
+    def arrays(self):
+        place = self.word(176)
+        while place:
+            yield place
+            place = self.word(place + 16)
+
+    def entry_ends(self, compact):
+        form, width = ("I", 4) if compact else ("Q", 8)
+        for array in self.arrays():
+            count = (self.word(array + 8) - 24) // width
+            for place in struct.unpack_from(f"<{count}{form}", self.journal, array + 24):
+                if place:
+                    yield place + self.word(place + 8)
+
+    def assert_comes_back(self, name, journal, least):
+        path = os.path.join(self.folder, "hurt.journal")
+        with open(path, "wb") as file:
+            file.write(journal)
+        figures = read(path, "--ours").figures
+        print(f"{RECOVERY_MB} MB, {name}: {figures['entries']} of {self.count}")
+        self.assertGreaterEqual(figures["entries"], least, name)
+        self.assertEqual(figures["repeated"], 0, name)
+
+    def test_what_is_not_damaged_comes_back_once(self):
+        for compact in (False, True):
+            self.count = RECOVERY_MB * 1300
+            with open(self.make(f"{compact}.journal", exported(self.count), compact, compress=False), "rb") as file:
+                self.journal = bytearray(file.read())
+            rng = random.Random(1)
+            for array in list(self.arrays()):
+                kept = bytes(self.journal[array:array + 24])
+                self.journal[array:array + 24] = bytes(24)
+                self.assert_comes_back("array header zeroed", self.journal, self.count)
+                self.journal[array:array + 24] = kept[:16] + struct.pack("<Q", array)
+                self.assert_comes_back("array linked to itself", self.journal, self.count)
+                self.journal[array:array + 24] = kept
+            hurt = bytearray(self.journal)
+            for _ in range(RECOVERY_MB):
+                hurt[rng.randrange(4096, len(hurt))] = rng.randrange(256)
+            self.assert_comes_back(f"{RECOVERY_MB} bytes overwritten", hurt, self.count * 0.999)
+            last = self.word(136)
+            end = last + self.word(last + 8) - 16384
+            before = sum(place <= end for place in self.entry_ends(compact))
+            self.assert_comes_back("cut by 16 KiB", self.journal[:end], before)
+
+
+class Live(ReadingTest):
+    def send(self, count):
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as sender:
+            for number in range(count):
+                sender.sendto(f"MESSAGE=point {number}\nTESSEL_KIND=event\nTESSEL_NAME=Open{number % 9}\n".encode(),
+                              "/run/systemd/journal/socket")
+
+    def wait_for(self, condition):
+        end = time.monotonic() + 20
+        while not condition():
+            self.assertLess(time.monotonic(), end)
+            time.sleep(0.02)
+
+    def sync(self):
+        command = ["journalctl", "--sync"]
+        self.wait_for(lambda: subprocess.run(command, capture_output=True, check=False).returncode == 0)
+
+    def online(self):
+        with open(os.path.join(LIVE, os.listdir(LIVE)[0], "system.journal"), "rb") as file:
+            return file.read(17)[16] == 1
+
+    def test_online_rotated_left_behind_sealed_and_of_users(self):
+        for user in (None, 1000, 1001):
+            subprocess.run(["systemd-cat"], input=b"line\n" * 50, user=user, check=True)
+        self.send(500)
+        self.sync()
+        self.assertGreaterEqual(self.assert_all_agree(LIVE)["files"], 3)
+        subprocess.run(["journalctl", "--rotate"], check=True)
+        self.sync()
+        self.send(100)
+        self.wait_for(self.online)
+        os.kill(int(os.environ["JOURNALD_PID"]), signal.SIGKILL)
+        self.assert_all_agree(LIVE)
+        daemon = subprocess.Popen(["/lib/systemd/systemd-journald"], stderr=subprocess.DEVNULL)
+        self.addCleanup(daemon.wait)
+        self.addCleanup(daemon.terminate)
+        self.sync()
+        self.send(10)
+        self.sync()
+        self.assertTrue(any(name.endswith(".journal~") for name in os.listdir(os.path.join(LIVE, os.listdir(LIVE)[0]))))
+        self.assertGreaterEqual(self.assert_all_agree(LIVE)["entries"], 660)
+
+    def test_a_rotation_while_it_is_read_neither_loses_nor_doubles_a_file(self):
+        sent, ended = [0], threading.Event()
+
+        def rotate():
+            while not ended.is_set():
+                self.send(200)
+                self.sync()
+                sent[0] += 200
+                subprocess.run(["journalctl", "--rotate"], check=True)
+
+        self.sync()
+        rotator = threading.Thread(target=rotate)
+        rotator.start()
+        try:
+            before = read(LIVE, "--ours").figures["entries"] if os.listdir(LIVE) else 0
+            for _ in range(OPTIONS.rotations):
+                least = before + sent[0] - 200
+                result = read(LIVE, "--ours")
+                self.assertGreaterEqual(result.figures["entries"], least)
+                self.assertEqual(result.figures["repeated"], 0)
+                self.assertNotIn("problem", result.stdout)
+        finally:
+            ended.set()
+            rotator.join()
+
+
+if __name__ == "__main__":
+    parser = argparse.ArgumentParser()
+    parser.add_argument("--compare", required=True)
+    parser.add_argument("--rotations", type=int, default=20)
+    OPTIONS, rest = parser.parse_known_args()
+    unittest.main(argv=[__file__, *rest])
