@@ -132,7 +132,7 @@ class Recovery(ReadingTest):
 
     def test_what_is_not_damaged_comes_back_once(self):
         for compact in (False, True):
-            self.count = RECOVERY_MB * 1300
+            self.count = RECOVERY_MB * 950
             with open(self.make(f"{compact}.journal", exported(self.count), compact, compress=False), "rb") as file:
                 self.journal = bytearray(file.read())
             rng = random.Random(1)

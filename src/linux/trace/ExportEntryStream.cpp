@@ -13,8 +13,6 @@ namespace {
 
 // A line longer than this, beyond what is shown of one, is read in pieces.
 constexpr size_t kLongLine = kMaxFieldHead;
-// Memory of an entry that a stream holds on to for the next.
-constexpr size_t kUsualEntry = 1024;
 
 bool isFieldName(std::string_view name) {
   const auto valid = [](char c) {
@@ -74,8 +72,14 @@ void ExportEntryStream::startEntry() {
   entryPlace_ = window_.place();
 }
 
+size_t ExportEntryStream::keptBeyondUsual(size_t added) const {
+  const size_t memory = kept_.size() + keptFields_.size() * sizeof(KeptField) + added;
+  return memory - std::min(memory, kUsualEntry);
+}
+
+// Gives back what was kept; memory for a usual entry stays for the next.
 void ExportEntryStream::dropKept() {
-  resources_.bytesKept -= kept_.size() + keptFields_.size() * sizeof(KeptField);
+  resources_.bytesKept -= keptBeyondUsual(0);
   kept_.clear();
   keptFields_.clear();
   if (kept_.capacity() > kUsualEntry) kept_ = {};
@@ -168,12 +172,13 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   if (keptFields_.size() == kMaxFieldsKept || kept_.size() + head.size() > kMaxBytesKept) {
     return bad("entry with too many fields");
   }
-  const size_t memory = head.size() + sizeof(KeptField);
-  if (resources_.bytesKept + memory > kMaxBytesKeptByAll) {
+  const size_t more = keptBeyondUsual(head.size() + sizeof(KeptField)) - keptBeyondUsual(0);
+  if (resources_.bytesKept + more > kMaxBytesKeptByAll) {
     return bad("entry too large beside those of other files");
   }
-  resources_.bytesKept += memory;
-  keptFields_.push_back({kept_.size(), head.size(), size});
+  resources_.bytesKept += more;
+  keptFields_.push_back({static_cast<uint32_t>(kept_.size()), static_cast<uint32_t>(head.size()),
+                         static_cast<uint32_t>(std::min<uint64_t>(size, UINT32_MAX))});
   kept_ += head;
   return Outcome::complete;
 }

@@ -23,7 +23,7 @@ namespace tessel {
 // What the export streams of one store share, to stay within a fixed amount of memory.
 struct ExportReadResources {
   WindowBudget& windows;
-  size_t bytesKept = 0;              // of the current entries of all streams
+  size_t bytesKept = 0;              // of the current entries of all streams, beyond what is usual
   std::string longHead{};            // of a line that is read in pieces
   std::vector<FieldToken> tokens{};  // of the entry that is looked at
 };
@@ -35,7 +35,9 @@ class ExportEntryStream final : public EntryStream {
   // Most that is kept of one entry, of the fields that the tokenizer wants.
   static constexpr size_t kMaxFieldsKept = 1024;
   static constexpr size_t kMaxBytesKept = size_t{1024} * 1024;
-  // Most that all streams keep of their current entries, bookkeeping included.
+  // What any stream may keep of an entry, and the most that all may keep beyond, both with the
+  // bookkeeping.
+  static constexpr size_t kUsualEntry = 1024;
   static constexpr size_t kMaxBytesKeptByAll = 4 * kMaxBytesKept;
 
   // Takes the descriptor and closes it. Problems are added to `report`; its entries are not
@@ -55,12 +57,13 @@ class ExportEntryStream final : public EntryStream {
     uint64_t size = 0;      // of the whole line without its newline
   };
   struct KeptField {
-    size_t offset;
-    size_t length;
-    uint64_t size;
+    uint32_t offset;
+    uint32_t length;
+    uint32_t size;
   };
 
   void startEntry();
+  size_t keptBeyondUsual(size_t added) const;
   void dropKept();
   Outcome readEntry();
   Outcome readField(const Line& line);
