@@ -1,21 +1,37 @@
 #include "linux/trace/EntrySearch.h"
 
 #include <algorithm>
+#include <array>
 
 namespace tessel {
 
 using namespace journal_format;
 
 EntrySearch::EntrySearch(JournalFile& file, uint64_t start, uint64_t end, const StopFlag& stop)
-    : file_(file), stop_(stop), end_(end), position_(start) {}
+    : file_(file), stop_(stop), start_(start), end_(end), position_(start) {}
+
+bool EntrySearch::mayHoldObject(uint64_t offset) const {
+  const uint64_t end = searchEnd();
+  return offset <= file_.header().lastObject && offset < end && end - offset >= kObjectHeaderSize;
+}
 
 std::optional<ObjectHeader> EntrySearch::objectAt(uint64_t offset) {
-  const uint64_t end = searchEnd();
-  if (offset > file_.header().lastObject || offset >= end || end - offset < kObjectHeaderSize)
-    return std::nullopt;
+  if (!mayHoldObject(offset)) return std::nullopt;
   const uint8_t* at = file_.file().at(offset, kObjectHeaderSize);
   if (at == nullptr) return std::nullopt;
-  return file_.objectHeader({at, kObjectHeaderSize}, end - offset);
+  return file_.objectHeader({at, kObjectHeaderSize}, searchEnd() - offset);
+}
+
+// The same without moving the window, for a place that a damaged size may have made up.
+bool EntrySearch::objectBeginsAt(uint64_t offset) {
+  if (!mayHoldObject(offset)) return false;
+  std::array<uint8_t, kObjectHeaderSize> bytes;
+  const uint8_t* at = file_.file().inWindow(offset, bytes.size());
+  if (at == nullptr) {
+    if (file_.file().read(offset, bytes) != bytes.size()) return false;
+    at = bytes.data();
+  }
+  return file_.objectHeader({at, bytes.size()}, searchEnd() - offset).has_value();
 }
 
 std::optional<uint64_t> EntrySearch::next() {
@@ -43,7 +59,7 @@ void EntrySearch::noteDamage(uint64_t offset) {
 // Finds the next object where none is at `offset`. It may lie before: then the size of the last
 // object was wrong.
 bool EntrySearch::resynchronise(uint64_t offset) {
-  if (!nextNonZero(offset)) return false;
+  if (offset >= onlyZerosFrom()) return false;
   noteDamage(offset);
   uint64_t candidate = lastObject_ ? *lastObject_ + kObjectHeaderSize : offset + 8;
   while (const auto found = nextNonZero(candidate)) {
@@ -61,22 +77,45 @@ bool EntrySearch::makesSense(uint64_t offset) {
   const auto object = objectAt(offset);
   if (!object) return false;
   const uint64_t next = alignUp(offset + object->size);
-  return next >= searchEnd() || next > file_.header().lastObject || objectAt(next).has_value() ||
-         !nextNonZero(next);
+  return next >= onlyZerosFrom() || next > file_.header().lastObject || objectBeginsAt(next);
 }
 
 uint64_t EntrySearch::searchEnd() const { return std::min(end_, file_.objectsEnd()); }
 
+// Where nothing but zeros is left of the stretch.
+uint64_t EntrySearch::onlyZerosFrom() {
+  if (onlyZerosFrom_) return *onlyZerosFrom_;
+  uint64_t from = start_;
+  uint64_t offset = start_;
+  while (const auto words = wordsAt(offset)) {
+    for (size_t size = words->size(); size > 0; size -= 8) {
+      if (load<uint64_t>(words->data() + size - 8) == 0) continue;
+      from = offset + size;
+      break;
+    }
+    offset = file_.file().nextWritten(offset + words->size());
+  }
+  return *(onlyZerosFrom_ = from);
+}
+
+// The eight-byte words from `offset` on that one window holds; nothing at the end, or soon after
+// the stop flag was set.
+std::optional<std::span<const uint8_t>> EntrySearch::wordsAt(uint64_t offset) {
+  const uint64_t end = searchEnd();
+  if (offset >= end || end - offset < 8 || stop_.load(std::memory_order_relaxed) ||
+      file_.file().at(offset, 8) == nullptr)
+    return std::nullopt;
+  const auto words = file_.file().restOfWindow(offset);
+  return words.first(static_cast<size_t>(std::min<uint64_t>(words.size(), end - offset)) &
+                     ~size_t{7});
+}
+
 // The first of the eight-byte words from `offset` on that is not all zeros.
 std::optional<uint64_t> EntrySearch::nextNonZero(uint64_t offset) {
-  const uint64_t end = searchEnd();
-  while (offset < end && end - offset >= 8 && !stop_.load(std::memory_order_relaxed)) {
-    if (file_.file().at(offset, 8) == nullptr) return std::nullopt;
-    auto words = file_.file().restOfWindow(offset);
-    if (words.size() > end - offset) words = words.first(static_cast<size_t>(end - offset));
-    for (; words.size() >= 8; words = words.subspan(8), offset += 8)
-      if (load<uint64_t>(words.data()) != 0) return offset;
-    offset = file_.file().nextWritten(offset);
+  while (const auto words = wordsAt(offset)) {
+    for (size_t at = 0; at < words->size(); at += 8)
+      if (load<uint64_t>(words->data() + at) != 0) return offset + at;
+    offset = file_.file().nextWritten(offset + words->size());
   }
   return std::nullopt;
 }

@@ -2,7 +2,9 @@
 // that lists them.
 //
 // Where an object is not what the format allows, the search goes back to just behind the last one
-// that was and tries every eighth byte from there on, until two objects in a row make sense.
+// that was and tries every eighth byte from there on, until two objects in a row make sense. It
+// never goes over the same stretch twice, whatever the file holds, so its time is bounded by the
+// file's size.
 //
 // Threads: one at a time, but for the stop flag.
 
@@ -10,6 +12,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <span>
 
 #include "linux/trace/JournalFile.h"
 
@@ -28,18 +31,24 @@ class EntrySearch {
   uint64_t firstDamage() const { return firstDamage_; }
 
  private:
+  bool mayHoldObject(uint64_t offset) const;
   std::optional<ObjectHeader> objectAt(uint64_t offset);
+  bool objectBeginsAt(uint64_t offset);
   bool resynchronise(uint64_t offset);
   bool makesSense(uint64_t offset);
   std::optional<uint64_t> nextNonZero(uint64_t offset);
+  std::optional<std::span<const uint8_t>> wordsAt(uint64_t offset);
+  uint64_t onlyZerosFrom();
   uint64_t searchEnd() const;
   void noteDamage(uint64_t offset);
 
   JournalFile& file_;
   const StopFlag& stop_;
+  const uint64_t start_;
   const uint64_t end_;
   uint64_t position_;
   std::optional<uint64_t> lastObject_;
+  std::optional<uint64_t> onlyZerosFrom_;
   uint64_t damagedPlaces_ = 0;
   uint64_t firstDamage_ = 0;
 };
