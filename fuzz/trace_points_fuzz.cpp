@@ -61,7 +61,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     table.beginEntry();
     std::vector<FieldToken> tokens;
     for (std::string_view line = takeLine(rest); !line.empty(); line = takeLine(rest)) {
-      const FieldToken token = table.tokenFor(line.substr(0, kMaxFieldHead), line.size());
+      const std::string_view name = line.substr(0, line.find('='));
+      if (name.size() == line.size()) continue;
+      const std::string_view value = line.substr(name.size() + 1);
+      const FieldToken token =
+          table.tokenFor(name, value.substr(0, kMaxFieldValueLength + 1), value.size());
       if (token != kNoToken) tokens.push_back(token);
     }
     assembler.consume({header, tokens});

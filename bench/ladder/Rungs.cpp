@@ -21,7 +21,9 @@ class Glance final : public FieldTokenizer {
   bool wants(std::string_view name) const override {
     return name.starts_with("TESSEL_") || name == "_EXE" || name == "_COMM" || name == "_PID";
   }
-  FieldToken tokenFor(std::string_view, uint64_t) override { return 1; }
+  FieldToken tokenFor(std::string_view name, std::string_view, uint64_t) override {
+    return wants(name) ? 1 : kNoToken;
+  }
   uint32_t generation() const override { return 0; }
   void beginEntry() override {}
 };

@@ -65,30 +65,31 @@ void SharedString::release() {
   ::operator delete(const_cast<StringRecord*>(record_));
 }
 
-StringRef StringPool::intern(std::string_view text) {
+StringPool::Noted StringPool::internNoted(std::string_view text) {
   if (size_ * 2 >= slots_.size()) grow();
   const uint64_t hash = hashText(text);
+  const auto half = static_cast<uint32_t>(hash);
   const size_t mask = slots_.size() - 1;
-  for (size_t at = hash & mask;; at = (at + 1) & mask) {
-    SharedString& slot = slots_[at];
-    if (!slot) {
-      slot = SharedString(text, hash);
+  for (size_t at = half & mask;; at = (at + 1) & mask) {
+    Slot& slot = slots_[at];
+    if (!slot.string) {
+      slot = {SharedString(text, hash), half, 0};
       ++size_;
       textBytes_ += sizeof(StringRecord) + text.size();
-      return slot;
+      return {slot.string, slot.note};
     }
-    if (slot.hash() == hash && slot.text() == text) return slot;
+    if (slot.hash == half && slot.string.text() == text) return {slot.string, slot.note};
   }
 }
 
 void StringPool::grow() {
-  std::vector<SharedString> old(slots_.empty() ? 64 : slots_.size() * 2);
+  std::vector<Slot> old(slots_.empty() ? 64 : slots_.size() * 2);
   old.swap(slots_);
   const size_t mask = slots_.size() - 1;
-  for (SharedString& kept : old) {
-    if (!kept) continue;
-    size_t at = kept.hash() & mask;
-    while (slots_[at]) at = (at + 1) & mask;
+  for (Slot& kept : old) {
+    if (!kept.string) continue;
+    size_t at = kept.hash & mask;
+    while (slots_[at].string) at = (at + 1) & mask;
     slots_[at] = std::move(kept);
   }
 }

@@ -117,16 +117,31 @@ class StringPool {
   StringPool(const StringPool&) = delete;
   StringPool& operator=(const StringPool&) = delete;
 
+  struct Noted {
+    StringRef string;
+    uint32_t& note;  // valid until the next call of either intern
+  };
+
   // The one record of this pool for `text`, made on first sight; valid while the pool lives.
-  StringRef intern(std::string_view text);
+  StringRef intern(std::string_view text) { return internNoted(text).string; }
+  // The same, with a number that the pool keeps for its user beside each string, 0 at first.
+  Noted internNoted(std::string_view text);
   size_t size() const { return size_; }
   // Bytes held by texts, records and the table.
-  size_t memoryUsed() const { return textBytes_ + slots_.capacity() * sizeof(SharedString); }
+  size_t memoryUsed() const { return textBytes_ + slots_.capacity() * sizeof(Slot); }
 
  private:
+  // The lower half of the hash stands beside the string, so that a search seldom looks at another
+  // record than the one it is for, and growing at none. A pool has fewer slots than that has values.
+  struct Slot {
+    SharedString string;
+    uint32_t hash = 0;
+    uint32_t note = 0;
+  };
+
   void grow();
 
-  std::vector<SharedString> slots_;
+  std::vector<Slot> slots_;
   size_t size_ = 0;
   size_t textBytes_ = 0;
 };

@@ -13,17 +13,11 @@ EntryChain::EntryChain(JournalFile& file)
   if (!enterArray(first) && file.header().entryCount != 0) damagedAt(first);
 }
 
-EntryChain::Step EntryChain::next() {
-  while (pieceNext_ == pieceSize_) {
-    if (!loadPiece()) return {std::nullopt, std::exchange(gap_, false)};
-  }
-  last_ = itemAt(pieceNext_++);
-  return {last_, std::exchange(gap_, false)};
-}
-
-uint64_t EntryChain::itemAt(size_t index) const {
-  const uint8_t* item = piece_.data() + index * itemSize_;
-  return itemSize_ == 4 ? load<uint32_t>(item) : load<uint64_t>(item);
+uint64_t EntryChain::firstOfNextPiece() {
+  bool more = true;
+  while (more && pieceNext_ == pieceSize_) more = loadPiece();
+  gapBefore_ = std::exchange(gap_, false);
+  return more ? last_ = itemAt(pieceNext_++) : 0;
 }
 
 // Makes the array at `offset` the one that is read.

@@ -18,22 +18,25 @@ namespace tessel {
 
 class EntryChain {
  public:
-  // What the chain knows of the next entry.
-  struct Step {
-    std::optional<uint64_t> offset;  // nothing: the chain ends here
-    bool gapBefore = false;          // entries that the chain does not list may come first
-  };
-
   // `file` must outlive the chain.
   explicit EntryChain(JournalFile& file);
 
-  // The next offset, greater than all before. `problemAt` of the last gap says where it was.
-  Step next();
+  // The offset of the next entry, greater than all before; 0 where the chain ends.
+  uint64_t next() {
+    gapBefore_ = false;
+    if (pieceNext_ == pieceSize_) [[unlikely]]
+      return firstOfNextPiece();
+    return last_ = itemAt(pieceNext_++);
+  }
+  // Whether entries that the chain does not list may come before what next() answered, and where
+  // the chain is damaged there.
+  bool gapBefore() const { return gapBefore_; }
   uint64_t problemAt() const { return problemAt_; }
 
  private:
   static constexpr size_t kPieceBytes = 1024;
 
+  uint64_t firstOfNextPiece();
   bool loadPiece();
   bool enterArray(uint64_t offset);
   void finishArray();
@@ -42,7 +45,11 @@ class EntryChain {
     gap_ = true;
     problemAt_ = offset;
   }
-  uint64_t itemAt(size_t index) const;
+  uint64_t itemAt(size_t index) const {
+    const uint8_t* item = piece_.data() + index * itemSize_;
+    return itemSize_ == 4 ? journal_format::load<uint32_t>(item)
+                          : journal_format::load<uint64_t>(item);
+  }
 
   JournalFile& file_;
   const size_t itemSize_;
@@ -55,7 +62,8 @@ class EntryChain {
   uint64_t arrayIndex_ = 0;  // items of it that were read
   uint64_t listed_ = 0;      // items read in all arrays
   uint64_t last_ = 0;        // greatest offset handed out
-  bool gap_ = false;
+  bool gap_ = false;         // since what was last handed out
+  bool gapBefore_ = false;   // before it
   uint64_t problemAt_ = 0;
 };
 

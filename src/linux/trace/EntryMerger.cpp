@@ -11,17 +11,17 @@ constexpr Id128 kNoId{};
 }
 
 bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
-  if (a.sequenceId == b.sequenceId && a.sequenceId != kNoId && a.sequenceNumber != b.sequenceNumber)
+  if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) && a.sequenceNumber != b.sequenceNumber)
     return a.sequenceNumber < b.sequenceNumber;
-  if (a.bootId == b.bootId && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
+  if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
   return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
          std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
 }
 
 bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
   return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
-         a.realtime == b.realtime && a.monotonic == b.monotonic && a.bootId == b.bootId &&
-         a.sequenceId == b.sequenceId && a.sequenceId != kNoId && a.contentHash != 0;
+         a.realtime == b.realtime && a.monotonic == b.monotonic && sameId(a.bootId, b.bootId) &&
+         sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) && a.contentHash != 0;
 }
 
 void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {

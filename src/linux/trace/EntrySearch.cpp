@@ -44,9 +44,9 @@ std::optional<uint64_t> EntrySearch::next() {
     }
     position_ = alignUp(offset + object->size);
     lastObject_ = offset;
-    uint64_t size = 0;
     if (object->type != kEntry) continue;
-    if (file_.entryAt(offset, offset, size)) return offset;
+    EntryHeader entry;
+    if (file_.readEntry(offset, offset, entry) != 0) return offset;
     noteDamage(offset);
   }
   return std::nullopt;

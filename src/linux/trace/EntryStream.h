@@ -12,6 +12,7 @@
 #include <array>
 #include <atomic>
 #include <cstdint>
+#include <cstring>
 #include <span>
 #include <string_view>
 
@@ -24,6 +25,14 @@ inline constexpr FieldToken kFirstReservedToken = 0x80000000;
 
 using Id128 = std::array<uint8_t, 16>;
 
+inline bool sameId(const Id128& a, const Id128& b) {
+  uint64_t left[2];
+  uint64_t right[2];
+  std::memcpy(left, a.data(), sizeof left);
+  std::memcpy(right, b.data(), sizeof right);
+  return left[0] == right[0] && left[1] == right[1];
+}
+
 // Longest name of a field and longest value that a tokenizer is shown in full.
 inline constexpr size_t kMaxFieldNameLength = 64;
 inline constexpr size_t kMaxFieldValueLength = 4096;
@@ -35,10 +44,11 @@ class FieldTokenizer {
   virtual ~FieldTokenizer() = default;
   // Whether a field of this name can ever have a token; asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
-  // The token of one FIELD=value. `head` is its beginning, up to kMaxFieldHead bytes; `size` its
-  // whole length in bytes, as far as known: where `head` is only its beginning, it may be any number
-  // greater than head.size(). The same text may be shown more than once.
-  virtual FieldToken tokenFor(std::string_view head, uint64_t size) = 0;
+  // The token of one FIELD=value; kNoToken for a field that is not wanted. `value` is the value's
+  // beginning, at least kMaxFieldValueLength + 1 bytes where there are so many; `size` its whole
+  // length in bytes, as far as known: where `value` is only the beginning, it may be any number
+  // greater than value.size(). The same text may be shown more than once.
+  virtual FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) = 0;
   // Changes when all tokens handed out so far become void (the tokenizer was emptied to stay within
   // its memory); a reader then drops what it remembers and asks again. Changes only inside
   // beginEntry().
@@ -58,9 +68,10 @@ struct EntryHeader {
   uint64_t contentHash = 0;  // exclusive or of the hashes of its data; 0: unknown
 };
 
+// Valid until the next call of next().
 struct Entry {
-  EntryHeader header;
-  std::span<const FieldToken> tokens;  // valid until the next call of next()
+  const EntryHeader& header;
+  std::span<const FieldToken> tokens;
 };
 
 // Set from any thread; readers look at it often enough to end within a few milliseconds.

@@ -177,8 +177,10 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
     return bad("entry too large beside those of other files");
   }
   resources_.bytesKept += more;
-  keptFields_.push_back({static_cast<uint32_t>(kept_.size()), static_cast<uint32_t>(head.size()),
-                         static_cast<uint32_t>(std::min<uint64_t>(size, UINT32_MAX))});
+  const uint64_t valueSize = size - nameLength - 1;
+  keptFields_.push_back({static_cast<uint32_t>(kept_.size()), static_cast<uint32_t>(nameLength),
+                         static_cast<uint32_t>(head.size()),
+                         static_cast<uint32_t>(std::min<uint64_t>(valueSize, UINT32_MAX))});
   kept_ += head;
   return Outcome::complete;
 }
@@ -235,7 +237,8 @@ Entry ExportEntryStream::entry() {
   resources_.tokens.clear();
   for (const KeptField& field : keptFields_) {
     const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);
-    const FieldToken token = tokenizer_.tokenFor(head, field.size);
+    const FieldToken token = tokenizer_.tokenFor(head.substr(0, field.nameLength),
+                                                 head.substr(field.nameLength + 1), field.size);
     if (token != kNoToken) resources_.tokens.push_back(token);
   }
   return {header_, resources_.tokens};

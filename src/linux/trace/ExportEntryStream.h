@@ -58,8 +58,9 @@ class ExportEntryStream final : public EntryStream {
   };
   struct KeptField {
     uint32_t offset;
-    uint32_t length;
-    uint32_t size;
+    uint32_t nameLength;
+    uint32_t length;  // of what is kept, name and all
+    uint32_t size;    // of the whole value
   };
 
   void startEntry();

@@ -12,6 +12,14 @@ FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }
 
+// Whether an entry has no field of a trace point but what the daemon adds to every entry.
+bool isPlainLogEvent(std::span<const FieldToken> tokens) {
+  return std::all_of(tokens.begin(), tokens.end(), [](FieldToken token) {
+    const FieldKind kind = TracePointTable::kind(token);
+    return kind >= FieldKind::imagePath && kind <= FieldKind::process;
+  });
+}
+
 }  // namespace
 
 IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
@@ -30,15 +38,8 @@ AssemblyCounts IntervalAssembler::counts() const {
 }
 
 void IntervalAssembler::consume(const Entry& entry) {
-  if (entry.tokens.empty()) return;
+  if (isPlainLogEvent(entry.tokens)) return;
   read(entry.tokens);
-  if (point_[FieldKind::pointKind] == kNoToken && point_.malformed == kNoToken) {
-    const auto writerEnd = point_.tokens.begin() + kWriterSlots;
-    const bool plainLogEvent =
-        point_.attributes.empty() &&
-        std::all_of(point_.tokens.begin(), writerEnd, [](FieldToken t) { return t == kNoToken; });
-    if (plainLogEvent) return;
-  }
   if (const auto reason = fault()) {
     ++counts_.malformed[static_cast<size_t>(*reason)];
     return;
@@ -60,7 +61,7 @@ void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   point_.attributes.clear();
   point_.malformed = kNoToken;
   for (const FieldToken token : tokens) {
-    const FieldKind kind = table_.kind(token);
+    const FieldKind kind = TracePointTable::kind(token);
     if (kind < FieldKind::attribute) [[likely]] {
       point_.tokens[static_cast<size_t>(kind)] = token;
     } else if (kind == FieldKind::attribute) {

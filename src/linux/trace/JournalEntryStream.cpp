@@ -8,6 +8,11 @@ namespace tessel {
 
 using namespace journal_format;
 
+namespace {
+// Answered in place of a token where a data object is not what it should be. No token has this value.
+constexpr FieldToken kDamaged = UINT32_MAX;
+}  // namespace
+
 JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header,
                                        uint32_t number, const Context& context)
     : file_(std::move(fd), size, header, context.resources.windows),
@@ -15,54 +20,55 @@ JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const Journal
       context_(context),
       chain_(file_),
       searchedTo_(header.headerSize),
-      firstFresh_(header.headerSize) {}
+      firstFresh_(header.headerSize) {
+  entry_.sequenceId = header.sequenceId;
+}
 
 bool JournalEntryStream::next() {
   while (!context_.stop.load(std::memory_order_relaxed)) {
-    const auto offset = nextOffset();
-    if (!offset) {
+    const uint64_t offset = search_ || pending_ != 0 ? nextFound() : nextListed();
+    if (offset == 0) {
       // An end that comes with the stop is none of the file's.
       if (!context_.stop.load(std::memory_order_relaxed)) finish();
       return false;
     }
-    if (take(*offset)) return true;
+    if (take(offset)) return true;
   }
   return false;
 }
 
-// Where the next entry should be, by the search that is under way or else by the chain.
-std::optional<uint64_t> JournalEntryStream::nextOffset() {
-  for (;;) {
-    if (search_) {
-      if (const auto found = search_->next()) return found;
-      endSearch();
-      if (pending_) return std::exchange(pending_, std::nullopt);
-    }
-    if (finished_) return std::nullopt;
-    const EntryChain::Step step = chain_.next();
-    finished_ = !step.offset;
-    if (!step.gapBefore) return step.offset;
-    context_.report.addProblem("entry array damaged", chain_.problemAt());
-    pending_ = step.offset;
-    searchUntil(step.offset.value_or(file_.objectsEnd()));
+// Where the chain has the next entry. Where it has a gap before that, the search comes first.
+uint64_t JournalEntryStream::nextListed() {
+  if (finished_) return 0;
+  const uint64_t offset = chain_.next();
+  finished_ = offset == 0;
+  if (!chain_.gapBefore()) [[likely]]
+    return offset;
+  searchUpTo(offset);
+  return nextFound();
+}
+
+// Where the search that is under way has the next entry, and then the chain.
+uint64_t JournalEntryStream::nextFound() {
+  if (search_) {
+    if (const auto found = search_->next()) return *found;
+    endSearch();
   }
+  if (pending_ != 0) return std::exchange(pending_, 0);
+  return nextListed();
 }
 
 // Makes the entry at `offset` the current one; false where it is none, and then what lies around it
 // is searched, up to the next that the chain lists.
 bool JournalEntryStream::take(uint64_t offset) {
-  uint64_t size = 0;
-  const auto entry = file_.entryAt(offset, searchedTo_, size);
-  if (!entry) {
+  const uint64_t size = file_.readEntry(offset, searchedTo_, entry_);
+  if (size == 0) {
     context_.report.addProblem("entry damaged", offset);
-    const EntryChain::Step step = chain_.next();
-    finished_ = !step.offset;
-    if (step.gapBefore) context_.report.addProblem("entry array damaged", chain_.problemAt());
-    pending_ = step.offset;
-    searchUntil(step.offset.value_or(file_.objectsEnd()));
+    const uint64_t next = chain_.next();
+    finished_ = next == 0;
+    searchUpTo(next);
     return false;
   }
-  entry_ = *entry;
   entryOffset_ = offset;
   entrySize_ = size;
   firstFresh_ = searchedTo_;
@@ -71,7 +77,11 @@ bool JournalEntryStream::take(uint64_t offset) {
   return true;
 }
 
-void JournalEntryStream::searchUntil(uint64_t end) {
+// Searches what lies before `listed`, the next entry of the chain; 0: the chain has ended.
+void JournalEntryStream::searchUpTo(uint64_t listed) {
+  if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
+  pending_ = listed;
+  const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
   search_.emplace(file_, std::min(searchedTo_, end), end, context_.stop);
 }
 
@@ -79,7 +89,7 @@ void JournalEntryStream::endSearch() {
   if (search_->damagedPlaces() != 0)
     context_.report.addProblem("objects damaged", search_->firstDamage(), search_->damagedPlaces());
   search_.reset();
-  if (pending_) searchedTo_ = std::max(searchedTo_, *pending_);
+  searchedTo_ = std::max(searchedTo_, pending_);
 }
 
 void JournalEntryStream::finish() {
@@ -94,12 +104,12 @@ void JournalEntryStream::finish() {
 
 Entry JournalEntryStream::entry() {
   context_.tokenizer.beginEntry();
-  tokens_.clear();
-  collectTokens();
-  return {entry_, tokens_};
+  const size_t count = collectTokens();
+  return {entry_, std::span(context_.resources.tokens).first(count)};
 }
 
-void JournalEntryStream::collectTokens() {
+// Answers how many there are.
+size_t JournalEntryStream::collectTokens() {
   const size_t all = file_.itemCount(entrySize_);
   const size_t count = std::min(all, JournalFile::kMaxItems);
   if (all > count) context_.report.addProblem("entry with too many fields", entryOffset_);
@@ -107,56 +117,62 @@ void JournalEntryStream::collectTokens() {
   const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), firstFresh_);
   if (items == nullptr) {
     context_.report.addProblem("entry damaged", entryOffset_);
-    return;
+    return 0;
   }
-  tokens_.resize(count);
-  size_t kept = 0;
-  const uint32_t generation = context_.tokenizer.generation();
-  for (size_t i = 0; i < count && !context_.stop.load(std::memory_order_relaxed); ++i) {
-    const FieldToken token = tokenAt(file_.itemAt(items, i), generation);
-    tokens_[kept] = token;
-    kept += token != kNoToken;
-  }
-  tokens_.resize(kept);
+  return file_.header().compact() ? tokensOf<uint32_t>(items, count)
+                                  : tokensOf<uint64_t>(items, count);
 }
 
-// The token of the data object at `offset`.
-FieldToken JournalEntryStream::tokenAt(uint64_t offset, uint32_t generation) {
-  if (offset < firstFresh_) [[likely]] {
-    const FieldToken known = context_.resources.tokens.find(number_, offset, generation);
-    if (known != TokenCache::kUnknown) [[likely]]
-      return known;
+template <typename Item>
+size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
+  context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
+  const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
+  const size_t step = file_.itemSize();
+  FieldToken* const tokens = context_.resources.tokens.data();
+  FieldToken* kept = tokens;
+  for (size_t i = 0; i < count; ++i) {
+    const uint64_t offset = load<Item>(items + i * step);
+    FieldToken token = cache.find(offset);
+    if (token == TokenCache::kUnknown) [[unlikely]] {
+      if (context_.stop.load(std::memory_order_relaxed)) break;
+      token = newTokenAt(offset);
+    }
+    *kept = token;
+    kept += token != kNoToken;
   }
-  return newTokenAt(offset, generation);
+  return static_cast<size_t>(kept - tokens);
 }
 
 // Looks at a data object. What only this entry refers to is not remembered, nor is what is none: it
 // may lie across one that is.
-FieldToken JournalEntryStream::newTokenAt(uint64_t offset, uint32_t generation) {
-  const auto data = file_.dataAt(offset, context_.resources.data);
-  const auto token = data ? readToken(*data) : std::nullopt;
-  if (!token) context_.report.addProblem("data object damaged", offset);
-  if (data && (offset < firstFresh_ || data->entryCount != 1))
-    context_.resources.tokens.store(number_, offset, generation, token.value_or(kNoToken));
-  return token.value_or(kNoToken);
+FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
+  DataObject data;
+  if (!file_.readData(offset, context_.resources.data, data)) {
+    context_.report.addProblem("data object damaged", offset);
+    return kNoToken;
+  }
+  FieldToken token =
+      data.compression == 0 ? textToken(data.head, data.payloadSize) : decompressToken(data);
+  if (token == kDamaged) {
+    context_.report.addProblem("data object damaged", offset);
+    token = kNoToken;
+  }
+  if (offset < firstFresh_ || data.entryCount != 1)
+    TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, token);
+  return token;
 }
 
-std::optional<FieldToken> JournalEntryStream::readToken(const DataObject& data) {
-  if (data.compression != 0) return decompressToken(data);
-  return textToken(data.head, data.payloadSize);
-}
-
-std::optional<FieldToken> JournalEntryStream::textToken(std::span<const uint8_t> head,
+FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head,
                                                         uint64_t size) {
   const std::string_view text(reinterpret_cast<const char*>(head.data()), head.size());
   const size_t nameLength = text.substr(0, kMaxFieldNameLength + 1).find('=');
-  if (nameLength == std::string_view::npos || nameLength == 0) return std::nullopt;
-  if (!context_.tokenizer.wants(text.substr(0, nameLength))) return kNoToken;
-  return context_.tokenizer.tokenFor(text, size);
+  if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
+  return context_.tokenizer.tokenFor(text.substr(0, nameLength), text.substr(nameLength + 1),
+                                     size - nameLength - 1);
 }
 
 // Decompresses the name first, and the value only where the name is wanted.
-std::optional<FieldToken> JournalEntryStream::decompressToken(const DataObject& data) {
+FieldToken JournalEntryStream::decompressToken(const DataObject& data) {
   const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> target) {
     const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);
     const auto length = static_cast<size_t>(std::min<uint64_t>(left, target.size()));
@@ -166,13 +182,13 @@ std::optional<FieldToken> JournalEntryStream::decompressToken(const DataObject& 
   const std::span<uint8_t> text = context_.resources.text;
   const auto name =
       decompressor.decompress(data.compression, source, text.first(kMaxFieldNameLength + 1));
-  if (!name) return std::nullopt;
+  if (!name) return kDamaged;
   const std::string_view start(reinterpret_cast<const char*>(text.data()), name->produced);
   const size_t nameLength = start.find('=');
-  if (nameLength == std::string_view::npos || nameLength == 0) return std::nullopt;
+  if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
   if (!context_.tokenizer.wants(start.substr(0, nameLength))) return kNoToken;
   const auto whole = decompressor.decompress(data.compression, source, text);
-  if (!whole) return std::nullopt;
+  if (!whole) return kDamaged;
   return textToken(text.first(whole->produced),
                    whole->complete ? whole->produced : text.size() + 1);
 }

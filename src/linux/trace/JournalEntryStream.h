@@ -11,7 +11,6 @@
 
 #include <array>
 #include <optional>
-#include <vector>
 
 #include "linux/trace/Decompressor.h"
 #include "linux/trace/EntryChain.h"
@@ -26,10 +25,11 @@ namespace tessel {
 // What the readers of all files of a store share, to stay within a fixed amount of memory.
 struct JournalReadResources {
   WindowBudget windows;
-  TokenCache tokens;
+  TokenCache tokenCache;
   Decompressor decompressor;
   std::array<uint8_t, JournalFile::kMaxDataRead> data;
   std::array<uint8_t, kMaxFieldHead> text;
+  std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the entry that is looked at
 };
 
 class JournalEntryStream final : public EntryStream {
@@ -52,24 +52,25 @@ class JournalEntryStream final : public EntryStream {
   Entry entry() override;
 
  private:
-  std::optional<uint64_t> nextOffset();
+  uint64_t nextListed();
+  uint64_t nextFound();
   bool take(uint64_t offset);
-  void searchUntil(uint64_t end);
+  void searchUpTo(uint64_t listed);
   void endSearch();
   void finish();
-  void collectTokens();
-  FieldToken tokenAt(uint64_t offset, uint32_t generation);
-  FieldToken newTokenAt(uint64_t offset, uint32_t generation);
-  std::optional<FieldToken> readToken(const DataObject& data);
-  std::optional<FieldToken> decompressToken(const DataObject& data);
-  std::optional<FieldToken> textToken(std::span<const uint8_t> head, uint64_t size);
+  size_t collectTokens();
+  template <typename Item>
+  size_t tokensOf(const uint8_t* items, size_t count);
+  FieldToken newTokenAt(uint64_t offset);
+  FieldToken decompressToken(const DataObject& data);
+  FieldToken textToken(std::span<const uint8_t> head, uint64_t size);
 
   JournalFile file_;
   const uint32_t number_;
   Context context_;
   EntryChain chain_;
   std::optional<EntrySearch> search_;
-  std::optional<uint64_t> pending_;  // what the chain lists behind the stretch being searched
+  uint64_t pending_ = 0;   // what the chain lists behind the stretch being searched; 0: nothing
   bool finished_ = false;  // the chain has ended
   bool reported_ = false;  // what was missing is in the report
   uint64_t delivered_ = 0;
@@ -78,7 +79,6 @@ class JournalEntryStream final : public EntryStream {
   EntryHeader entry_;
   uint64_t entryOffset_ = 0;
   uint64_t entrySize_ = 0;
-  std::vector<FieldToken> tokens_;
 };
 
 }  // namespace tessel

@@ -68,7 +68,7 @@ void JournalExtractor::processEntries(EntryStream& entries) {
   while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
     if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
     const Entry entry = entries.entry();
-    current_ = entry.header;
+    current_ = &entry.header;
     assembler_.consume(entry);
   }
   report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);

@@ -54,8 +54,8 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   const StopFlag& stopFlag() const { return stop_; }
 
   // Where the entry stands that the object of the running callback came from; an interval comes
-  // from its end.
-  const EntryHeader& currentEntry() const { return current_; }
+  // from its end. REQUIRES: a callback is running.
+  const EntryHeader& currentEntry() const { return *current_; }
   // About what was processed so far; the store's part is there after the processing call.
   ExtractionReport report() const;
 
@@ -80,7 +80,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   bool buildCompositeTimelines_ = false;
   ServiceStatus* status_ = nullptr;
 
-  EntryHeader current_;
+  const EntryHeader* current_ = nullptr;  // while an entry is looked at
   ExtractionReport report_;
 };
 

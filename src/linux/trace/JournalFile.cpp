@@ -34,7 +34,7 @@ uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
 
 Id128 loadId(const uint8_t* at) {
   Id128 id;
-  std::copy_n(at, id.size(), id.begin());
+  std::memcpy(id.data(), at, id.size());
   return id;
 }
 
@@ -92,7 +92,7 @@ JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header
                          WindowBudget& budget)
     : header_(header),
       file_(std::move(fd), size, budget),
-      itemSize_(header.compact() ? kCompactEntryItemSize : kEntryItemSize),
+      itemShift_(std::countr_zero(header.compact() ? kCompactEntryItemSize : kEntryItemSize)),
       dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
 
 std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> bytes,
@@ -109,16 +109,15 @@ std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> b
   return object;
 }
 
-std::optional<EntryHeader> JournalFile::entryAt(uint64_t offset, uint64_t from, uint64_t& size) {
-  if (!mayHoldObject(offset, kEntryItemsAt)) return std::nullopt;
+uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
+  if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
-  if (at == nullptr) return std::nullopt;
-  const auto object = objectHeader({at, kEntryItemsAt}, objectsEnd() - offset);
-  if (!object || object->type != kEntry || (object->size - kEntryItemsAt) % itemSize_ != 0 ||
-      object->size == kEntryItemsAt)
-    return std::nullopt;
-  EntryHeader entry;
-  entry.sequenceId = header_.sequenceId;
+  // An entry has no flags.
+  if (at == nullptr || load<uint64_t>(at) != kEntry) return 0;
+  const auto size = load<uint64_t>(at + kObjectSizeAt);
+  if (size <= kEntryItemsAt || size > objectsEnd() - offset ||
+      (size - kEntryItemsAt) % itemSize() != 0)
+    return 0;
   entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
   entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
   entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
@@ -126,40 +125,34 @@ std::optional<EntryHeader> JournalFile::entryAt(uint64_t offset, uint64_t from, 
   entry.contentHash = load<uint64_t>(at + kEntryHashAt);
   if (entry.sequenceNumber == 0 || entry.realtime == 0 || entry.realtime >= kMaxTime ||
       entry.monotonic >= kMaxTime)
-    return std::nullopt;
-  size = object->size;
-  return entry;
+    return 0;
+  return size;
 }
 
-std::optional<DataObject> JournalFile::checkedData(std::span<const uint8_t> bytes,
-                                                   uint64_t offset) const {
-  const auto object = objectHeader(bytes, objectsEnd() - offset);
-  if (!object || object->type != kData || bytes.size() <= dataHeaderSize_) return std::nullopt;
-  return DataObject{object->flags,
-                    load<uint64_t>(bytes.data() + kDataEntryCountAt),
-                    offset + dataHeaderSize_,
-                    object->size - dataHeaderSize_,
-                    {}};
-}
-
-std::optional<DataObject> JournalFile::dataAt(uint64_t offset,
-                                              std::span<uint8_t, kMaxDataRead> scratch) {
-  if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return std::nullopt;
+bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch,
+                           DataObject& data) {
+  if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return false;
+  const uint64_t wanted = dataHeaderSize_ + kMaxFieldHead;
   std::span<const uint8_t> bytes = file_.restOfWindow(offset);
-  const uint64_t size =
-      bytes.size() < kObjectHeaderSize ? UINT64_MAX : load<uint64_t>(bytes.data() + kObjectSizeAt);
-  const size_t wanted = dataHeaderSize_ + kMaxFieldHead;
-  if (bytes.size() < std::min<uint64_t>(size, wanted)) {
-    const uint64_t room = std::min<uint64_t>(wanted, objectsEnd() - offset);
+  if (bytes.size() < wanted &&
+      (bytes.size() < kObjectHeaderSize ||
+       bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
+    const uint64_t room = std::min(wanted, objectsEnd() - offset);
     bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(room)})};
-    if (bytes.size() <= dataHeaderSize_) return std::nullopt;
   }
-  auto data = checkedData(bytes, offset);
-  if (!data) return std::nullopt;
-  data->head = bytes.subspan(
-      dataHeaderSize_, static_cast<size_t>(std::min<uint64_t>(
-                           {data->payloadSize, kMaxFieldHead, bytes.size() - dataHeaderSize_})));
-  return data;
+  if (bytes.size() <= dataHeaderSize_) return false;
+  const auto first = load<uint64_t>(bytes.data());
+  data.compression = static_cast<uint8_t>(first >> 8);
+  // Type and flags, then six reserved bytes.
+  if ((first & ~(uint64_t{kKnownDataFlags} << 8)) != kData) return false;
+  const auto size = load<uint64_t>(bytes.data() + kObjectSizeAt);
+  if (size <= dataHeaderSize_ || size > objectsEnd() - offset) return false;
+  data.entryCount = load<uint64_t>(bytes.data() + kDataEntryCountAt);
+  data.payloadOffset = offset + dataHeaderSize_;
+  data.payloadSize = size - dataHeaderSize_;
+  data.head = bytes.first(static_cast<size_t>(std::min(size, std::min<uint64_t>(wanted, bytes.size()))))
+                  .subspan(dataHeaderSize_);
+  return true;
 }
 
 }  // namespace tessel

@@ -87,32 +87,26 @@ class JournalFile {
   // and that ends within `room` bytes. REQUIRES: bytes.size() >= kObjectHeaderSize.
   std::optional<ObjectHeader> objectHeader(std::span<const uint8_t> bytes, uint64_t room) const;
 
-  // The entry object at `offset`, read by way of the window, which keeps what lies behind `from`
-  // in view; nothing where there is none. Sets `size` to its size in bytes.
-  std::optional<EntryHeader> entryAt(uint64_t offset, uint64_t from, uint64_t& size);
+  // Fills `entry`, but for its sequence, which is the file's, from the entry object at `offset`,
+  // read by way of the window, which keeps what lies behind `from` in view. Answers the size of the
+  // object in bytes; 0 where there is none.
+  uint64_t readEntry(uint64_t offset, uint64_t from, EntryHeader& entry);
   // Number of data objects that an entry of `size` bytes refers to.
   size_t itemCount(uint64_t size) const {
-    return static_cast<size_t>((size - journal_format::kEntryItemsAt) / itemSize_);
+    return static_cast<size_t>((size - journal_format::kEntryItemsAt) >> itemShift_);
   }
-  // Offset of the data object that item `index` refers to, not yet checked.
-  uint64_t itemAt(const uint8_t* items, size_t index) const {
-    return header_.compact() ? journal_format::load<uint32_t>(items + index * itemSize_)
-                             : journal_format::load<uint64_t>(items + index * itemSize_);
-  }
-  size_t itemSize() const { return itemSize_; }
+  size_t itemSize() const { return size_t{1} << itemShift_; }
   // Bytes of a data object that are read at most, payload included.
   static constexpr size_t kMaxDataRead = journal_format::kCompactDataHeaderSize + kMaxFieldHead;
 
-  // The data object at `offset` with up to kMaxFieldHead bytes of its payload; nothing where there
-  // is none. The window stays; what it does not hold is read into `scratch`.
-  std::optional<DataObject> dataAt(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch);
+  // Fills `data` from the data object at `offset`, with up to kMaxFieldHead bytes of its payload;
+  // false where there is none. The window stays; what it does not hold is read into `scratch`.
+  bool readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch, DataObject& data);
 
  private:
-  std::optional<DataObject> checkedData(std::span<const uint8_t> bytes, uint64_t offset) const;
-
   const JournalHeader header_;
   WindowedFile file_;
-  const size_t itemSize_;
+  const int itemShift_;  // the size of an item is a power of two; division is slow
   const size_t dataHeaderSize_;
 };
 

@@ -26,13 +26,14 @@ bool LossTokenizer::wants(std::string_view fieldName) const {
          fieldName == kUnit;
 }
 
-FieldToken LossTokenizer::tokenFor(std::string_view head, uint64_t size) {
-  const std::string_view name = head.substr(0, head.find('='));
-  const std::string_view value = head.substr(std::min(name.size() + 1, head.size()));
-  if (name == kMessageId && value == kLossMessage) return kLossToken;
-  if (name == kCount) return valueToken(value, counts_, kFirstCount);
-  if (name == kUnit) return valueToken(value, units_, kFirstUnit);
-  return user_.wants(name) ? user_.tokenFor(head, size) : kNoToken;
+FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view value, uint64_t size) {
+  if (field == kMessageId && value == kLossMessage) {
+    met_ = true;
+    return kLossToken;
+  }
+  if (field == kCount) return valueToken(value, counts_, kFirstCount);
+  if (field == kUnit) return valueToken(value, units_, kFirstUnit);
+  return user_.tokenFor(field, value, size);
 }
 
 FieldToken LossTokenizer::valueToken(std::string_view value, std::vector<std::string>& values,
@@ -47,6 +48,7 @@ FieldToken LossTokenizer::valueToken(std::string_view value, std::vector<std::st
 }
 
 std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
+  if (!met_) return tokens;
   FieldToken highest = 0;
   for (const FieldToken token : tokens) highest = std::max(highest, token);
   if (!isOurs(highest)) return tokens;

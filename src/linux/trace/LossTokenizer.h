@@ -23,7 +23,7 @@ class LossTokenizer final : public FieldTokenizer {
   explicit LossTokenizer(FieldTokenizer& user) : user_(user) {}
 
   bool wants(std::string_view fieldName) const override;
-  FieldToken tokenFor(std::string_view head, uint64_t size) override;
+  FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return user_.generation(); }
   void beginEntry() override { user_.beginEntry(); }
 
@@ -38,6 +38,7 @@ class LossTokenizer final : public FieldTokenizer {
   DroppedEntries& unitNamed(const std::string& unit);
 
   FieldTokenizer& user_;
+  bool met_ = false;  // an entry may tell of a loss
   std::vector<std::string> counts_;
   std::vector<std::string> units_;
   std::vector<DroppedEntries> dropped_;

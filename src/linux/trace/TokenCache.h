@@ -12,62 +12,83 @@
 #include <algorithm>
 #include <array>
 #include <cstdint>
-#include <vector>
+#include <memory>
 
 #include "linux/trace/EntryStream.h"
 
 namespace tessel {
 
 class TokenCache {
- public:
-  // Answered where nothing is remembered. No token has this value.
-  static constexpr FieldToken kUnknown = UINT32_MAX;
-
-  TokenCache() : lines_(kLines) {}
-
-  // The token of the data object at `offset` of file `file`; kUnknown where it was not stored under
-  // this generation of tokens.
-  FieldToken find(uint32_t file, uint64_t offset, uint32_t generation) const {
-    const uint64_t region = regionOf(file, offset);
-    const Line& line = lines_[lineOf(region)];
-    if (line.region != region || line.generation != generation) return kUnknown;
-    return line.tokens[wordOf(offset)];
-  }
-  void store(uint32_t file, uint64_t offset, uint32_t generation, FieldToken token) {
-    const uint64_t region = regionOf(file, offset);
-    Line& line = lines_[lineOf(region)];
-    if (line.region != region || line.generation != generation) {
-      line.region = region;
-      line.generation = generation;
-      line.tokens.fill(kUnknown);
-    }
-    line.tokens[wordOf(offset)] = token;
-  }
-
  private:
   static constexpr int kLineBits = 14;
   static constexpr size_t kLines = size_t{1} << kLineBits;
   static constexpr int kWordShift = 6;
   static constexpr size_t kWords = 64;
   static constexpr int kRegionShift = 12;
+  static constexpr int kFileShift = 50;
   static_assert(kWords << kWordShift == size_t{1} << kRegionShift);
+  using Line = std::array<FieldToken, kWords>;
 
-  struct Line {
-    uint64_t region = 0;
-    uint32_t generation = 0;
-    std::array<FieldToken, kWords> tokens;
+ public:
+  // Answered where nothing is remembered. No token has this value.
+  static constexpr FieldToken kUnknown = UINT32_MAX;
+
+  TokenCache()
+      : regions_(std::make_unique<uint64_t[]>(kLines)),
+        lines_(std::make_unique_for_overwrite<Line[]>(kLines)) {}
+
+  // Forgets everything where what it remembers is of another generation of tokens.
+  void useGeneration(uint32_t generation) {
+    if (generation == generation_) [[likely]]
+      return;
+    generation_ = generation;
+    std::fill_n(regions_.get(), kLines, 0);
+  }
+
+  // What is remembered of one file. Valid while the cache lives, and small enough to be made for
+  // every entry.
+  class OfFile {
+   public:
+    OfFile(TokenCache& cache, uint32_t file)
+        : regions_(cache.regions_.get()),
+          lines_(cache.lines_.get()),
+          file_(uint64_t{file + 1} << kFileShift) {}
+
+    // The token of the data object at `offset`; kUnknown where it is not remembered.
+    FieldToken find(uint64_t offset) const {
+      const uint64_t region = regionOf(offset);
+      const size_t line = lineOf(region);
+      return regions_[line] == region ? lines_[line][wordOf(offset)] : kUnknown;
+    }
+    void store(uint64_t offset, FieldToken token) {
+      const uint64_t region = regionOf(offset);
+      const size_t line = lineOf(region);
+      if (regions_[line] != region) {
+        regions_[line] = region;
+        lines_[line].fill(kUnknown);
+      }
+      lines_[line][wordOf(offset)] = token;
+    }
+
+   private:
+    // Never 0, so that an empty line is of no region.
+    uint64_t regionOf(uint64_t offset) const { return file_ | offset >> kRegionShift; }
+
+    uint64_t* regions_;
+    Line* lines_;
+    uint64_t file_;
   };
 
-  // Never 0, so that an empty line is of no region.
-  static uint64_t regionOf(uint32_t file, uint64_t offset) {
-    return uint64_t{file + 1} << 50 | offset >> kRegionShift;
-  }
+ private:
   static size_t lineOf(uint64_t region) {
     return static_cast<size_t>(region * 0x9e3779b97f4a7c15u >> (64 - kLineBits));
   }
   static size_t wordOf(uint64_t offset) { return offset >> kWordShift & (kWords - 1); }
 
-  std::vector<Line> lines_;
+  uint32_t generation_ = 0;
+  // Of each line; apart from them, as a lookup reads this first.
+  const std::unique_ptr<uint64_t[]> regions_;
+  const std::unique_ptr<Line[]> lines_;  // a line has its words from when it has a region
 };
 
 }  // namespace tessel

@@ -37,7 +37,6 @@ enum class FieldKind : uint8_t {
   malformed,
   boot,
 };
-inline constexpr size_t kWriterSlots = static_cast<size_t>(FieldKind::imagePath);
 inline constexpr size_t kPointSlots = static_cast<size_t>(FieldKind::attribute);
 
 enum class PointKind : uint8_t { event, begin, end };

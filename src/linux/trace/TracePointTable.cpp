@@ -53,15 +53,14 @@ bool TracePointTable::wants(std::string_view fieldName) const {
   return fieldKindOf(fieldName).has_value();
 }
 
-FieldToken TracePointTable::tokenFor(std::string_view head, uint64_t size) {
-  const size_t equals = head.find('=');
-  if (equals == std::string_view::npos) return kNoToken;
-  const std::optional<FieldKind> kind = fieldKindOf(head.substr(0, equals));
+FieldToken TracePointTable::tokenFor(std::string_view field, std::string_view value,
+                                     uint64_t size) {
+  const std::optional<FieldKind> kind = fieldKindOf(field);
   if (!kind) return kNoToken;
-  if (size - equals - 1 > kMaxFieldValueLength) {
+  if (size > kMaxFieldValueLength) {
     return isDaemonField(*kind) ? kNoToken : addOnce(malformedField(MalformedReason::valueTooLong));
   }
-  return parse(*kind, head.substr(equals + 1));
+  return parse(*kind, value);
 }
 
 FieldToken TracePointTable::parse(FieldKind kind, std::string_view value) {
@@ -86,7 +85,7 @@ FieldToken TracePointTable::parse(FieldKind kind, std::string_view value) {
     case FieldKind::process:
       return parseNumber(kind, value);
     default:
-      return addOnce(textField(kind, value));
+      return textToken(kind, value);
   }
 }
 
@@ -122,35 +121,44 @@ FieldToken TracePointTable::parseAttribute(std::string_view value) {
   if (equals == 0 || equals == std::string_view::npos) {
     return addOnce(malformedField(MalformedReason::invalidAttribute));
   }
-  contents_.attributes.emplace_back(contents_.strings->intern(value.substr(0, equals)),
-                                    contents_.strings->intern(value.substr(equals + 1)));
+  return addAttribute(value.substr(0, equals), value.substr(equals + 1));
+}
+
+FieldToken TracePointTable::addAttribute(std::string_view key, std::string_view value) {
+  contents_.attributes.emplace_back(contents_.strings->intern(key),
+                                    contents_.strings->intern(value));
   return add(wholeField(FieldKind::attribute, contents_.attributes.size() - 1));
 }
 
-TracePointTable::Field TracePointTable::textField(FieldKind kind, std::string_view value) {
+// The string's note is the token of the first kind of field that has this text; further kinds are
+// found by the index.
+FieldToken TracePointTable::textToken(FieldKind kind, std::string_view value) {
+  const auto [string, note] = contents_.strings->internNoted(value);
+  if (note != kNoToken && TracePointTable::kind(note) == kind) return note;
   Field field;
   field.kind = kind;
   field.form = Form::text;
-  field.record = contents_.strings->intern(value).record();
-  return field;
+  field.record = string.record();
+  return note == kNoToken ? note = add(field) : addOnce(field);
 }
 
 FieldToken TracePointTable::add(const Field& field) {
   contents_.fields.push_back(field);
-  return static_cast<FieldToken>(contents_.fields.size() - 1);
+  grown_ = true;
+  const size_t index = contents_.fields.size() - 1;
+  return static_cast<FieldToken>(field.kind) << kIndexBits | static_cast<FieldToken>(index);
 }
 
 FieldToken TracePointTable::addOnce(const Field& field) {
   if (contents_.indexed * 2 >= contents_.index.size()) growIndex();
   const size_t mask = contents_.index.size() - 1;
-  for (size_t at = hashOf(field.identity(), field.kind) & mask;; at = (at + 1) & mask) {
-    FieldToken& token = contents_.index[at];
+  for (size_t slot = hashOf(field.identity(), field.kind) & mask;; slot = (slot + 1) & mask) {
+    FieldToken& token = contents_.index[slot];
     if (token == kNoToken) {
       ++contents_.indexed;
       return token = add(field);
     }
-    const Field& known = contents_.fields[token];
-    if (known.kind == field.kind && known.identity() == field.identity()) return token;
+    if (kind(token) == field.kind && at(token).identity() == field.identity()) return token;
   }
 }
 
@@ -160,10 +168,9 @@ void TracePointTable::growIndex() {
   const size_t mask = contents_.index.size() - 1;
   for (const FieldToken token : old) {
     if (token == kNoToken) continue;
-    const Field& field = contents_.fields[token];
-    size_t at = hashOf(field.identity(), field.kind) & mask;
-    while (contents_.index[at] != kNoToken) at = (at + 1) & mask;
-    contents_.index[at] = token;
+    size_t slot = hashOf(at(token).identity(), kind(token)) & mask;
+    while (contents_.index[slot] != kNoToken) slot = (slot + 1) & mask;
+    contents_.index[slot] = token;
   }
 }
 
@@ -171,11 +178,11 @@ FieldToken TracePointTable::bootToken(const Id128& boot) {
   if (lastBootToken_ != kNoToken && boot == lastBoot_) return lastBootToken_;
   lastBoot_ = boot;
   const std::string_view bytes(reinterpret_cast<const char*>(boot.data()), boot.size());
-  return lastBootToken_ = addOnce(textField(FieldKind::boot, bytes));
+  return lastBootToken_ = textToken(FieldKind::boot, bytes);
 }
 
 std::optional<Number> TracePointTable::number(FieldToken token) const {
-  const Field& field = contents_.fields[token];
+  const Field& field = at(token);
   switch (field.form) {
     case Form::whole:
       return static_cast<int64_t>(field.whole);
@@ -189,11 +196,11 @@ std::optional<Number> TracePointTable::number(FieldToken token) const {
 }
 
 PointKind TracePointTable::pointKind(FieldToken token) const {
-  return static_cast<PointKind>(contents_.fields[token].whole);
+  return static_cast<PointKind>(at(token).whole);
 }
 
 MalformedReason TracePointTable::malformedReason(FieldToken token) const {
-  return static_cast<MalformedReason>(contents_.fields[token].whole);
+  return static_cast<MalformedReason>(at(token).whole);
 }
 
 // Whether the table holds more than its limits divided by `share`.
@@ -205,7 +212,7 @@ bool TracePointTable::holds(size_t share) const {
 bool TracePointTable::hasRoomForRenewal() const { return !holds(2); }
 
 void TracePointTable::beginEntry() {
-  if (!holds(1)) return;
+  if (!std::exchange(grown_, false) || !holds(1)) return;
   ++generation_;
   lastBootToken_ = kNoToken;
   Contents old = std::exchange(contents_, emptyContents(limits_));
@@ -218,25 +225,22 @@ void TracePointTable::beginEntry() {
 // Leaves a forwarding note in the old table, so that what many hold is renewed once.
 FieldToken TracePointTable::renewed(FieldToken old) {
   if (old == kNoToken) return kNoToken;
-  Field& field = old_->fields[old];
+  Field& field = old_->fields[indexOf(old)];
   if (field.form != Form::forwarded) {
-    const Field fresh = renewedField(field);
-    field.whole = fresh.form == Form::text || fresh.kind == FieldKind::process ||
-                          fresh.kind <= FieldKind::telemetry
-                      ? addOnce(fresh)
-                      : add(fresh);
+    field.whole = addAgain(field);
     field.form = Form::forwarded;
   }
   return static_cast<FieldToken>(field.whole);
 }
 
-TracePointTable::Field TracePointTable::renewedField(const Field& field) {
-  if (field.form == Form::text) return textField(field.kind, StringRef(field.record).text());
-  if (field.kind != FieldKind::attribute) return field;
-  const auto& [key, value] = old_->attributes[field.whole];
-  contents_.attributes.emplace_back(contents_.strings->intern(key.text()),
-                                    contents_.strings->intern(value.text()));
-  return wholeField(FieldKind::attribute, contents_.attributes.size() - 1);
+FieldToken TracePointTable::addAgain(const Field& old) {
+  if (old.form == Form::text) return textToken(old.kind, StringRef(old.record).text());
+  if (old.kind == FieldKind::attribute) {
+    const auto& [key, value] = old_->attributes[old.whole];
+    return addAttribute(key.text(), value.text());
+  }
+  const bool once = old.kind == FieldKind::process || old.kind <= FieldKind::telemetry;
+  return once ? addOnce(old) : add(old);
 }
 
 }  // namespace tessel

@@ -1,6 +1,6 @@
 // TracePointTable: each distinct FIELD=value of the store, parsed and interned once.
 //
-// A token is an index into the table. Equal values of a string, a process or a boot have equal
+// A token is a kind of field and an index into the table. Equal values of a string, a process or a boot have equal
 // tokens, so whoever pairs or counts compares small integers. The table is bounded: over its limits
 // it is emptied between two entries and starts a new generation, with a new string pool; delivered
 // objects keep the old pool alive as long as they need it, and a TokenHolder takes along what it
@@ -33,7 +33,7 @@ class TokenHolder {
 };
 
 struct TracePointTableLimits {
-  size_t fields = size_t{512} * 1024;          // distinct values
+  size_t fields = size_t{512} * 1024;          // distinct values; at most 16 million
   size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
 };
 
@@ -45,28 +45,28 @@ class TracePointTable final : public FieldTokenizer {
   void setHolder(TokenHolder* holder) { holder_ = holder; }
 
   bool wants(std::string_view fieldName) const override;
-  FieldToken tokenFor(std::string_view head, uint64_t size) override;
+  FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return generation_; }
   void beginEntry() override;
 
   FieldToken bootToken(const Id128& boot);
 
   // The value of a token of this generation; what `kNoToken` stands for is absent.
-  FieldKind kind(FieldToken token) const { return contents_.fields[token].kind; }
-  StringRef text(FieldToken token) const { return StringRef(contents_.fields[token].record); }
+  static FieldKind kind(FieldToken token) { return FieldKind(token >> kIndexBits); }
+  StringRef text(FieldToken token) const { return StringRef(at(token).record); }
   std::optional<Number> number(FieldToken token) const;
   // REQUIRES: the token is one of a duration or a frame rate.
-  float real(FieldToken token) const { return contents_.fields[token].real; }
+  float real(FieldToken token) const { return at(token).real; }
   // REQUIRES: the token is one of a point kind; of a scope or the telemetry flag; of what is
   // malformed.
   PointKind pointKind(FieldToken token) const;
   bool flag(FieldToken token) const {
-    return token != kNoToken && contents_.fields[token].whole != 0;
+    return token != kNoToken && at(token).whole != 0;
   }
   MalformedReason malformedReason(FieldToken token) const;
   // REQUIRES: the token is one of an attribute.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {
-    return contents_.attributes[contents_.fields[token].whole];
+    return contents_.attributes[at(token).whole];
   }
   // Keeps every string of this generation alive.
   std::shared_ptr<const StringPool> strings() const { return contents_.strings; }
@@ -100,22 +100,30 @@ class TracePointTable final : public FieldTokenizer {
     size_t indexed = 0;
   };
 
+  // Below the kind in a token. The kinds leave the tokens of the store itself free.
+  static constexpr int kIndexBits = 24;
+  static_assert(FieldToken(FieldKind::boot) < kFirstReservedToken >> kIndexBits);
+
+  static size_t indexOf(FieldToken token) { return token & ((1u << kIndexBits) - 1); }
+  const Field& at(FieldToken token) const { return contents_.fields[indexOf(token)]; }
   static Field wholeField(FieldKind kind, uint64_t value);
   static Field malformedField(MalformedReason reason);
   static Contents emptyContents(const TracePointTableLimits& limits);
   FieldToken parse(FieldKind kind, std::string_view value);
   FieldToken parseNumber(FieldKind kind, std::string_view value);
   FieldToken parseAttribute(std::string_view value);
-  Field textField(FieldKind kind, std::string_view value);
+  FieldToken addAttribute(std::string_view key, std::string_view value);
+  FieldToken textToken(FieldKind kind, std::string_view value);
   FieldToken add(const Field& field);
   FieldToken addOnce(const Field& field);
   void growIndex();
   bool holds(size_t share) const;
-  Field renewedField(const Field& field);
+  FieldToken addAgain(const Field& old);
 
   const TracePointTableLimits limits_;
   TokenHolder* holder_ = nullptr;
   uint32_t generation_ = 0;
+  bool grown_ = false;  // since the limits were looked at
   Contents contents_;
   Contents* old_ = nullptr;  // while tokens are renewed
   Id128 lastBoot_{};

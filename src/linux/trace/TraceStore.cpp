@@ -19,7 +19,7 @@ namespace {
 class SequenceWatch {
  public:
   void see(const EntryHeader& entry) {
-    if (last_ < seen_.size() && seen_[last_].id == entry.sequenceId) {
+    if (last_ < seen_.size() && sameId(seen_[last_].id, entry.sequenceId)) {
       advance(seen_[last_], entry.sequenceNumber);
     } else {
       change(entry);

@@ -21,10 +21,10 @@ using Lines = std::vector<std::string>;
 class RecordingTokenizer final : public FieldTokenizer {
  public:
   bool wants(std::string_view name) const override { return name.starts_with('T'); }
-  FieldToken tokenFor(std::string_view head, uint64_t size) override {
-    texts.emplace_back(head);
-    if (size != head.size())
-      texts.back() = std::string(head.substr(0, 6)) + "/" + std::to_string(size);
+  FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override {
+    texts.push_back(std::string(field) + "=" + std::string(value));
+    if (size != value.size())
+      texts.back() = texts.back().substr(0, 6) + "/" + std::to_string(size);
     return static_cast<FieldToken>(texts.size());
   }
   uint32_t generation() const override { return 0; }
@@ -123,7 +123,7 @@ TEST_P(ExportEntryStreamTest, showsOnlyTheHeadOfALongValue) {
   append("__REALTIME_TIMESTAMP=1\nT=" + longValue + "\n" + binary("T", longValue) +
          "MESSAGE=" + longValue + "\n\n");
   append(kGood);
-  EXPECT_THAT(readAll(), ElementsAre("1: T=xxxx/300002 T=xxxx/300002", "7: T=good"));
+  EXPECT_THAT(readAll(), ElementsAre("1: T=xxxx/300000 T=xxxx/300000", "7: T=good"));
 }
 
 TEST_P(ExportEntryStreamTest, goesOnAfterBadData) {

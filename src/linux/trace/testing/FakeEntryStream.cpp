@@ -12,9 +12,11 @@ Entry FakeEntryStream::entry() {
   tokenizer_.beginEntry();
   tokens_.clear();
   for (const std::string& field : entries[at_ - 1].fields) {
-    if (!tokenizer_.wants(std::string_view(field).substr(0, field.find('=')))) continue;
-    const std::string_view head = std::string_view(field).substr(0, kMaxFieldHead);
-    const FieldToken token = tokenizer_.tokenFor(head, field.size());
+    const std::string_view name = std::string_view(field).substr(0, field.find('='));
+    const std::string_view value = std::string_view(field).substr(name.size() + 1);
+    if (!tokenizer_.wants(name)) continue;
+    const FieldToken token =
+        tokenizer_.tokenFor(name, value.substr(0, kMaxFieldValueLength + 1), value.size());
     if (token != kNoToken) tokens_.push_back(token);
   }
   return {header(), tokens_};

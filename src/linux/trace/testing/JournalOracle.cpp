@@ -26,10 +26,11 @@ std::ostream& operator<<(std::ostream& out, const PlainEntry& entry) {
   return out;
 }
 
-FieldToken RecordingTokenizer::tokenFor(std::string_view head, uint64_t size) {
+FieldToken RecordingTokenizer::tokenFor(std::string_view field, std::string_view value,
+                                        uint64_t size) {
   ++shown_;
-  std::string text(head);
-  if (size > head.size()) text += "...";
+  std::string text = std::string(field) + "=" + std::string(value);
+  if (size > value.size()) text += "...";
   const auto [known, isNew] = tokens_.try_emplace(text, static_cast<FieldToken>(texts_.size() + 1));
   if (isNew) texts_.push_back(text);
   return known->second;

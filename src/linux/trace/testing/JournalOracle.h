@@ -25,7 +25,7 @@ std::ostream& operator<<(std::ostream& out, const PlainEntry& entry);
 class RecordingTokenizer final : public FieldTokenizer {
  public:
   bool wants(std::string_view) const override { return true; }
-  FieldToken tokenFor(std::string_view head, uint64_t size) override;
+  FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return 0; }
   void beginEntry() override {}
 
