@@ -33,22 +33,36 @@ void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
 bool EntryMerger::next() {
   if (started_ && !heap_.empty()) {
     dropDuplicates();
-    advance(0);
+    advanceFirst();
   } else if (!started_) {
     started_ = true;
     for (size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
+    runnerUp_ = findRunnerUp();
   }
   ++current_;
   return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
 }
 
-// Moves the stream at `index` to its next entry, or closes it at its end.
-void EntryMerger::advance(size_t index) {
-  if (!heap_[index].stream->next()) {
-    std::swap(heap_[index], heap_.back());
-    heap_.pop_back();
-  }
-  siftDown(index);
+// Most entries are followed by one of the same stream; then nothing moves.
+void EntryMerger::advanceFirst() {
+  const bool more = heap_.front().stream->next();
+  if (more && (runnerUp_ == 0 ||
+               !comesBefore(*heap_[runnerUp_].header, *heap_.front().header))) [[likely]]
+    return;
+  if (!more) close(0);
+  siftDown(0);
+  runnerUp_ = findRunnerUp();
+}
+
+void EntryMerger::close(size_t index) {
+  std::swap(heap_[index], heap_.back());
+  heap_.pop_back();
+}
+
+// The index of the stream that comes first but for the very first; 0: there is none.
+size_t EntryMerger::findRunnerUp() const {
+  if (heap_.size() < 2) return 0;
+  return heap_.size() > 2 && comesBefore(*heap_[2].header, *heap_[1].header) ? 2 : 1;
 }
 
 void EntryMerger::siftDown(size_t index) {
@@ -66,14 +80,16 @@ void EntryMerger::siftDown(size_t index) {
 // only be right below it, and what is below that comes up when it is skipped.
 void EntryMerger::dropDuplicates() {
   for (size_t child = 1; child <= 2 && child < heap_.size();) {
-    if (heap_[child].droppedAt != current_ &&
-        sameEntry(*heap_[child].header, *heap_.front().header)) {
-      heap_[child].droppedAt = current_;
-      ++duplicates_;
-      advance(child);
-    } else {
+    if (heap_[child].droppedAt == current_ ||
+        !sameEntry(*heap_[child].header, *heap_.front().header)) [[likely]] {
       ++child;
+      continue;
     }
+    heap_[child].droppedAt = current_;
+    ++duplicates_;
+    if (!heap_[child].stream->next()) close(child);
+    siftDown(child);
+    runnerUp_ = findRunnerUp();
   }
 }
 

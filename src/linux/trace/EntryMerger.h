@@ -49,13 +49,16 @@ class EntryMerger final : public EntryStream {
     uint64_t droppedAt = 0;  // of the current entries, by count, the last that it lost a twin of
   };
 
-  void advance(size_t index);
+  void advanceFirst();
+  void close(size_t index);
+  size_t findRunnerUp() const;
   void siftDown(size_t index);
   void dropDuplicates();
 
   const StopFlag& stop_;
   uint64_t& duplicates_;
   std::vector<Source> heap_;
+  size_t runnerUp_ = 0;
   bool started_ = false;
   uint64_t current_ = 0;  // entries delivered, the current one included
 };
