@@ -3,6 +3,7 @@
 #include "tools/tesselctl/Tally.h"
 
 #include <algorithm>
+#include <bit>
 #include <ctime>
 #include <numeric>
 
@@ -57,10 +58,16 @@ void Tally::count(const TesselObject& object, const FilterDecision& decision,
                   const EntryHeader& entry) {
   ++verdicts_[decision.classification];
   countKind(object, decision.shouldReport());
-  ++pairs_[{{object.subsystem(), object.category()}}][decision.classification];
+  countPair(object, decision.classification);
   countSlice(decision.classification, entry.realtime);
   if (decision.classification == TesselReporterClassificationFailedStringWhitelist)
     countMiss(object, decision);
+}
+
+void Tally::countPair(const TesselObject& object, TesselReporterClassification classification) {
+  const Borrowed<2> key{{object.subsystem(), object.category()}};
+  const auto known = pairs_.find(key);
+  ++(known != pairs_.end() ? known->second : pairs_[kept(key)])[classification];
 }
 
 void Tally::countKind(const TesselObject& object, bool reported) {
@@ -78,20 +85,35 @@ void Tally::countSlice(TesselReporterClassification classification, uint64_t rea
 }
 
 void Tally::countMiss(const TesselObject& object, const FilterDecision& decision) {
-  const Key<4> key{{object.subsystem(), object.category(), object.name(), decision.stringValue},
+  const Borrowed<4> key{{object.subsystem(), object.category(), object.name(), decision.stringValue},
                    decision.stringSlot};
-  if (const auto known = misses_.find(key); known != misses_.end()) {
-    ++known->second;
+  MissSlot& slot = missSlotOf(key);
+  if (slot.number != 0) {
+    ++misses_[slot.number - 1].count;
     return;
   }
   size_t bytes = 0;
-  for (const SharedString& text : key.texts) bytes += text.textOr("").size();
+  for (const StringRef text : key.texts) bytes += text.textOr("").size();
   if (misses_.size() >= kMaxMisses || missBytes_ + bytes > kMaxMissBytes) {
     ++missesNotListed_;
     return;
   }
   missBytes_ += bytes;
-  misses_.emplace(key, 1);
+  misses_.push_back({kept(key), 1});
+  slot = {static_cast<uint32_t>(Hash{}(key)), static_cast<uint32_t>(misses_.size())};
+}
+
+// The slot of the key, or the free one where it would stand.
+Tally::MissSlot& Tally::missSlotOf(const Borrowed<4>& key) {
+  static_assert(std::has_single_bit(kMaxMisses));
+  const auto hash = static_cast<uint32_t>(Hash{}(key));
+  const size_t mask = missSlots_.size() - 1;
+  for (size_t at = hash & mask;; at = (at + 1) & mask) {
+    MissSlot& slot = missSlots_[at];
+    if (slot.number == 0 ||
+        (slot.hash == hash && Equal{}(misses_[slot.number - 1].key, key)))
+      return slot;
+  }
 }
 
 std::vector<Tally::Pair> Tally::pairs() const {
