@@ -103,6 +103,10 @@ const std::vector<Rung>& rungs() {
       {"cat", nullptr, "cat $FILES >/dev/null", false},
       {"reader alone", readAlone, {}, false},
       {"reader and pairing", readAndPair, {}, false},
+      {"explain --summary", nullptr,
+       "$TESSELCTL explain --summary --store $DIRECTORY --since 2026-11-21 --until 2026-11-24 "
+       ">/dev/null",
+       false},
       {"libsystemd, all fields", libsystemdAll, {}, false},
       {"libsystemd, matches", libsystemdMatches, {}, false},
       {"journalctl -o export", nullptr, "journalctl -D $DIRECTORY -o export >/dev/null", true},

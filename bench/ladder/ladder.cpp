@@ -114,6 +114,8 @@ int runRung(const std::string& name, const std::string& directory) {
       if (entry.path().extension() == ".journal") files += " " + entry.path().string();
     ::setenv("FILES", files.c_str(), 1);
     ::setenv("DIRECTORY", directory.c_str(), 1);
+    const auto here = std::filesystem::read_symlink("/proc/self/exe").parent_path();
+    ::setenv("TESSELCTL", (here / "tesselctl").c_str(), 1);
     ::execl("/bin/sh", "sh", "-c", rung.command.c_str(), nullptr);
   }
   return 1;

@@ -132,7 +132,8 @@ class StringPool {
 
  private:
   // The lower half of the hash stands beside the string, so that a search seldom looks at another
-  // record than the one it is for, and growing at none. A pool has fewer slots than that has values.
+  // record than the one it is for, and growing at none. A pool has fewer slots than that has
+  // values.
   struct Slot {
     SharedString string;
     uint32_t hash = 0;

@@ -11,7 +11,8 @@ constexpr Id128 kNoId{};
 }
 
 bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
-  if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) && a.sequenceNumber != b.sequenceNumber)
+  if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) &&
+      a.sequenceNumber != b.sequenceNumber)
     return a.sequenceNumber < b.sequenceNumber;
   if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
   return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
@@ -46,8 +47,8 @@ bool EntryMerger::next() {
 // Most entries are followed by one of the same stream; then nothing moves.
 void EntryMerger::advanceFirst() {
   const bool more = heap_.front().stream->next();
-  if (more && (runnerUp_ == 0 ||
-               !comesBefore(*heap_[runnerUp_].header, *heap_.front().header))) [[likely]]
+  if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
+      [[likely]]
     return;
   if (!more) close(0);
   siftDown(0);

@@ -60,11 +60,11 @@ class FieldTokenizer {
 
 // Where an entry stands in time and in the journal's own order.
 struct EntryHeader {
-  Id128 sequenceId{};     // which sequence `sequenceNumber` counts in; all zero: unknown
+  Id128 sequenceId{};  // which sequence `sequenceNumber` counts in; all zero: unknown
   uint64_t sequenceNumber = 0;
   Id128 bootId{};
-  uint64_t monotonic = 0;  // microseconds since boot
-  uint64_t realtime = 0;   // microseconds since 1970, UTC
+  uint64_t monotonic = 0;    // microseconds since boot
+  uint64_t realtime = 0;     // microseconds since 1970, UTC
   uint64_t contentHash = 0;  // exclusive or of the hashes of its data; 0: unknown
 };
 

@@ -9,7 +9,8 @@ namespace tessel {
 using namespace journal_format;
 
 namespace {
-// Answered in place of a token where a data object is not what it should be. No token has this value.
+// Answered in place of a token where a data object is not what it should be. No token has this
+// value.
 constexpr FieldToken kDamaged = UINT32_MAX;
 }  // namespace
 
@@ -162,8 +163,7 @@ FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
   return token;
 }
 
-FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head,
-                                                        uint64_t size) {
+FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head, uint64_t size) {
   const std::string_view text(reinterpret_cast<const char*>(head.data()), head.size());
   const size_t nameLength = text.substr(0, kMaxFieldNameLength + 1).find('=');
   if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;

@@ -74,8 +74,8 @@ class JournalEntryStream final : public EntryStream {
   bool finished_ = false;  // the chain has ended
   bool reported_ = false;  // what was missing is in the report
   uint64_t delivered_ = 0;
-  uint64_t searchedTo_ = 0;   // before this, nothing is left to be found
-  uint64_t firstFresh_ = 0;   // data from here on is first referred to by the current entry
+  uint64_t searchedTo_ = 0;  // before this, nothing is left to be found
+  uint64_t firstFresh_ = 0;  // data from here on is first referred to by the current entry
   EntryHeader entry_;
   uint64_t entryOffset_ = 0;
   uint64_t entrySize_ = 0;

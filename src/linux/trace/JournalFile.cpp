@@ -134,9 +134,8 @@ bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scr
   if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return false;
   const uint64_t wanted = dataHeaderSize_ + kMaxFieldHead;
   std::span<const uint8_t> bytes = file_.restOfWindow(offset);
-  if (bytes.size() < wanted &&
-      (bytes.size() < kObjectHeaderSize ||
-       bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
+  if (bytes.size() < wanted && (bytes.size() < kObjectHeaderSize ||
+                                bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
     const uint64_t room = std::min(wanted, objectsEnd() - offset);
     bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(room)})};
   }
@@ -150,8 +149,9 @@ bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scr
   data.entryCount = load<uint64_t>(bytes.data() + kDataEntryCountAt);
   data.payloadOffset = offset + dataHeaderSize_;
   data.payloadSize = size - dataHeaderSize_;
-  data.head = bytes.first(static_cast<size_t>(std::min(size, std::min<uint64_t>(wanted, bytes.size()))))
-                  .subspan(dataHeaderSize_);
+  data.head =
+      bytes.first(static_cast<size_t>(std::min(size, std::min<uint64_t>(wanted, bytes.size()))))
+          .subspan(dataHeaderSize_);
   return true;
 }
 

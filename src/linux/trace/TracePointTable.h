@@ -1,10 +1,10 @@
 // TracePointTable: each distinct FIELD=value of the store, parsed and interned once.
 //
-// A token is a kind of field and an index into the table. Equal values of a string, a process or a boot have equal
-// tokens, so whoever pairs or counts compares small integers. The table is bounded: over its limits
-// it is emptied between two entries and starts a new generation, with a new string pool; delivered
-// objects keep the old pool alive as long as they need it, and a TokenHolder takes along what it
-// holds.
+// A token is a kind of field and an index into the table. Equal values of a string, a process or a
+// boot have equal tokens, so whoever pairs or counts compares small integers. The table is bounded:
+// over its limits it is emptied between two entries and starts a new generation, with a new string
+// pool; delivered objects keep the old pool alive as long as they need it, and a TokenHolder takes
+// along what it holds.
 //
 // Threads: one at a time. The strings may be read from any thread by whoever keeps the pool.
 
@@ -60,9 +60,7 @@ class TracePointTable final : public FieldTokenizer {
   // REQUIRES: the token is one of a point kind; of a scope or the telemetry flag; of what is
   // malformed.
   PointKind pointKind(FieldToken token) const;
-  bool flag(FieldToken token) const {
-    return token != kNoToken && at(token).whole != 0;
-  }
+  bool flag(FieldToken token) const { return token != kNoToken && at(token).whole != 0; }
   MalformedReason malformedReason(FieldToken token) const;
   // REQUIRES: the token is one of an attribute.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {

@@ -23,8 +23,7 @@ class RecordingTokenizer final : public FieldTokenizer {
   bool wants(std::string_view name) const override { return name.starts_with('T'); }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override {
     texts.push_back(std::string(field) + "=" + std::string(value));
-    if (size != value.size())
-      texts.back() = texts.back().substr(0, 6) + "/" + std::to_string(size);
+    if (size != value.size()) texts.back() = texts.back().substr(0, 6) + "/" + std::to_string(size);
     return static_cast<FieldToken>(texts.size());
   }
   uint32_t generation() const override { return 0; }

@@ -85,8 +85,9 @@ void Tally::countSlice(TesselReporterClassification classification, uint64_t rea
 }
 
 void Tally::countMiss(const TesselObject& object, const FilterDecision& decision) {
-  const Borrowed<4> key{{object.subsystem(), object.category(), object.name(), decision.stringValue},
-                   decision.stringSlot};
+  const Borrowed<4> key{
+      {object.subsystem(), object.category(), object.name(), decision.stringValue},
+      decision.stringSlot};
   MissSlot& slot = missSlotOf(key);
   if (slot.number != 0) {
     ++misses_[slot.number - 1].count;
@@ -110,8 +111,7 @@ Tally::MissSlot& Tally::missSlotOf(const Borrowed<4>& key) {
   const size_t mask = missSlots_.size() - 1;
   for (size_t at = hash & mask;; at = (at + 1) & mask) {
     MissSlot& slot = missSlots_[at];
-    if (slot.number == 0 ||
-        (slot.hash == hash && Equal{}(misses_[slot.number - 1].key, key)))
+    if (slot.number == 0 || (slot.hash == hash && Equal{}(misses_[slot.number - 1].key, key)))
       return slot;
   }
 }
