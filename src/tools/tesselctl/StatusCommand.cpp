@@ -1,28 +1,17 @@
 // status: does this machine report, and do the books balance?
 
-#include <pwd.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
-#include <array>
-#include <atomic>
 #include <cerrno>
 #include <memory>
 
-#include "linux/DeferralConditions.h"
 #include "linux/Files.h"
-#include "linux/RunRecord.h"
-#include "linux/StateDirectory.h"
-#include "linux/SystemClock.h"
-#include "linux/trace/TracePointTable.h"
-#include "linux/trace/TraceStore.h"
 #include "service/CookieFile.h"
 #include "tools/tesselctl/Environment.h"
 #include "tools/tesselctl/JsonLine.h"
+#include "tools/tesselctl/ReporterStatus.h"
 #include "tools/tesselctl/ShownText.h"
-#include "tools/tesselctl/SpoolReader.h"
-#include "tools/tesselctl/Tasking.h"
 #include "tools/tesselctl/Terminal.h"
 #include "tools/tesselctl/TimeArguments.h"
 #include "tools/tesselctl/Verdict.h"
@@ -30,99 +19,6 @@
 namespace tessel::ctl {
 
 namespace {
-
-constexpr std::chrono::hours kLookBack{24};  // of a run
-
-struct Marker {
-  bool present = false;
-  std::string owner;
-  Date since{};
-};
-
-struct JournalFacts {
-  std::optional<Date> oldest;
-  std::string failure;  // why it cannot be read; empty where it can
-};
-
-struct Status {
-  Date now{};
-  Tasking tasking;
-  std::string taskingWords;
-  std::optional<std::string> deferral;  // why one is wanted
-  Marker marker;
-  std::optional<RunRecord> run;
-  std::optional<Date> lastBegin;  // of the last run, recorded or not
-  SpoolReader::State spoolState = SpoolReader::State::absent;
-  std::string spoolFailure;
-  SpoolContents spool;
-  std::string store;
-  JournalFacts journal;
-
-  // A run that got as far as sending anything.
-  bool hasBooks() const {
-    return run &&
-           (run->outcome == RunOutcome::completed || run->outcome == RunOutcome::interrupted);
-  }
-  bool good() const {
-    if (run && run->outcome == RunOutcome::failed) return false;
-    if (hasBooks() && (!run->objectsBalance() || !run->rowsBalance())) return false;
-    return spoolState != SpoolReader::State::damaged;
-  }
-  bool keepsADay() const { return journal.oldest && *journal.oldest <= now - kLookBack; }
-  // The scheduler knows of a run that left no record.
-  bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
-};
-
-Marker lookForMarker() {
-  struct stat facts {};
-  Marker marker;
-  if (::lstat(cookieFilePath, &facts) != 0) return marker;
-  marker.present = true;
-  marker.since = Date{std::chrono::seconds{facts.st_mtim.tv_sec}};
-  const passwd* user = ::getpwuid(facts.st_uid);
-  marker.owner = user != nullptr ? user->pw_name : std::to_string(facts.st_uid);
-  return marker;
-}
-
-JournalFacts lookAtJournal(const std::optional<std::string>& store) {
-  TracePointTable table;
-  const StopFlag stop = false;
-  auto opened = TraceStore::open(store, TimeRange{}, table, stop);
-  JournalFacts facts;
-  if (const auto* error = std::get_if<PlatformError>(&opened)) {
-    facts.failure = error->localizedDescription;
-    return facts;
-  }
-  auto& trace = *std::get<std::unique_ptr<TraceStore>>(opened);
-  trace.entries().next();  // files whose headers do not tell show their first entry
-  if (const auto oldest = trace.report().oldestEntry) {
-    facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};
-  }
-  return facts;
-}
-
-Status gather(const LaunchConfiguration& launch) {
-  const StateDirectory state = StateDirectory::forReading(launch.stateDirectory);
-  Status status;
-  status.now = SystemClock().now();
-  status.tasking = askTasking(launch);
-  status.taskingWords = taskingWords(status.tasking, launch);
-  status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
-  status.marker = lookForMarker();
-  status.run = RunRecord::read(launch.stateDirectory);
-  status.lastBegin = state.lastRun();
-  SpoolReader spool(launch.stateDirectory);
-  status.spoolState = spool.open();
-  if (status.spoolState == SpoolReader::State::open) {
-    const auto contents = spool.contents();
-    if (!contents) status.spoolState = SpoolReader::State::damaged;
-    status.spool = contents.value_or(SpoolContents{});
-  }
-  status.spoolFailure = spool.reason();
-  status.store = storeName(launch.traceStore);
-  status.journal = lookAtJournal(launch.traceStore);
-  return status;
-}
 
 void addDate(JsonObject& object, std::string_view key, std::optional<Date> date) {
   if (date) object.number(key, Number{int64_t{date->time_since_epoch().count()}});
@@ -151,7 +47,7 @@ void writeRun(std::string& out, const RunRecord& run, bool hasBooks) {
   object.end();
 }
 
-void writeSpool(std::string& out, const Status& status) {
+void writeSpool(std::string& out, const ReporterStatus& status) {
   static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
   JsonObject object(out);
   object.text("state", kStates[static_cast<size_t>(status.spoolState)]);
@@ -175,7 +71,7 @@ void writeForwarder(std::string& out, const ForwarderCounters& counters) {
   object.end();
 }
 
-std::string statusJson(const Status& status) {
+std::string statusJson(const ReporterStatus& status) {
   std::string out;
   JsonObject object(out);
   object.boolean("good", status.good());
@@ -226,7 +122,7 @@ std::string statusJson(const Status& status) {
 // One screen for a human.
 class Screen {
  public:
-  explicit Screen(const Status& status)
+  explicit Screen(const ReporterStatus& status)
       : status_(status), terminal_(terminalBehind(STDOUT_FILENO)) {}
 
   std::string render() {
@@ -380,7 +276,7 @@ class Screen {
     }
   }
 
-  const Status& status_;
+  const ReporterStatus& status_;
   const Terminal terminal_;
   std::string out_;
 };
@@ -392,7 +288,7 @@ int runStatus(bool json) {
     return failToRead("state directory " + launch->stateDirectory + ": " + errorWords(EACCES),
                       launch->stateDirectory);
   }
-  const Status status = gather(*launch);
+  const ReporterStatus status = gatherStatus(*launch);
   print(json ? statusJson(status) : Screen(status).render());
   std::fflush(stdout);
   if (speaksOfPermission(status.journal.failure))
