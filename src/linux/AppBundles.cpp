@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "linux/Files.h"
+#include "linux/PlainText.h"
 
 namespace tessel {
 
@@ -68,13 +69,6 @@ std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& 
     entry.increment(error);
   }
   return found;
-}
-
-std::string_view trimmed(std::string_view text) {
-  constexpr std::string_view kBlanks = " \t\r\n";
-  const size_t begin = text.find_first_not_of(kBlanks);
-  if (begin == std::string_view::npos) return {};
-  return text.substr(begin, text.find_last_not_of(kBlanks) - begin + 1);
 }
 
 // The parser lets several roots pass, and text beside a root.

@@ -21,12 +21,12 @@ std::string lastError(const std::string& path) {
   return path + ": " + errorWords(error);
 }
 
+}  // namespace
+
 bool flushDirectory(const std::string& path) {
   const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   return directory.valid() && ::fsync(directory.get()) == 0;
 }
-
-}  // namespace
 
 std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text,
                                               unsigned permissions) {

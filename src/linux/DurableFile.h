@@ -1,4 +1,4 @@
-// Replacing a small file as a whole.
+// Files that must stand after a power cut.
 
 #pragma once
 
@@ -14,5 +14,8 @@ namespace tessel {
 // The reason in words where that fails; the old file then still stands.
 std::optional<std::string> replaceFileDurably(const std::string& path, std::string_view text,
                                               unsigned permissions = 0640);
+
+// Makes the names in the directory, as they are now, outlast a power cut; false where that fails.
+bool flushDirectory(const std::string& path);
 
 }  // namespace tessel

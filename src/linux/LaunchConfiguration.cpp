@@ -15,6 +15,7 @@ namespace {
 // A year: longer waits are typing mistakes, and every sum of times stays far from overflow.
 constexpr int64_t kMaxSeconds = 31'536'000;
 constexpr size_t kMaxQuotedValue = 256;
+constexpr std::string_view kBlanks = " \t";
 
 std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
   int64_t seconds = 0;
@@ -22,12 +23,6 @@ std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
   const auto [stopped, error] = std::from_chars(text.data(), end, seconds);
   if (error != std::errc() || stopped != end || seconds < 1 || seconds > kMaxSeconds) return {};
   return std::chrono::seconds{seconds};
-}
-
-std::string_view trimmed(std::string_view word) {
-  const size_t begin = word.find_first_not_of(" \t");
-  if (begin == std::string_view::npos) return {};
-  return word.substr(begin, word.find_last_not_of(" \t") - begin + 1);
 }
 
 bool enableSource(DeferSources& sources, std::string_view word) {
@@ -39,10 +34,10 @@ bool enableSource(DeferSources& sources, std::string_view word) {
 
 std::optional<DeferSources> deferSources(std::string_view list) {
   DeferSources sources;
-  if (trimmed(list).empty()) return sources;
+  if (trimmed(list, kBlanks).empty()) return sources;
   for (;;) {
     const size_t comma = list.find(',');
-    if (!enableSource(sources, trimmed(list.substr(0, comma)))) return {};
+    if (!enableSource(sources, trimmed(list.substr(0, comma), kBlanks))) return {};
     if (comma == std::string_view::npos) return sources;
     list.remove_prefix(comma + 1);
   }

@@ -1,4 +1,4 @@
-// Escaping for terminals.
+// Escaping for terminals, and blanks.
 
 #include "linux/PlainText.h"
 
@@ -53,6 +53,12 @@ std::string plainText(std::string_view text, std::string_view lineFeed) {
     text.remove_prefix(character.size());
   }
   return out;
+}
+
+std::string_view trimmed(std::string_view text, std::string_view blanks) {
+  const size_t begin = text.find_first_not_of(blanks);
+  if (begin == std::string_view::npos) return {};
+  return text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
 }
 
 }  // namespace tessel

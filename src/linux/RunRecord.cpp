@@ -14,7 +14,7 @@ namespace tessel {
 
 namespace {
 
-using Json = nlohmann::ordered_json;
+using OrderedJson = nlohmann::ordered_json;
 
 constexpr const char* kOutcomes[] = {"completed", "interrupted", "bailed_out", "failed"};
 constexpr size_t kMaxRecordBytes = size_t{1} << 20;
@@ -25,13 +25,13 @@ std::string recordPath(const std::string& stateDirectory) {
 
 int64_t microseconds(Date date) { return date.time_since_epoch().count(); }
 
-Json named(const RunRecord::Named& facts) {
-  Json object = Json::object();
+OrderedJson named(const RunRecord::Named& facts) {
+  OrderedJson object = OrderedJson::object();
   for (const auto& [name, value] : facts) object[name] = value;
   return object;
 }
 
-RunRecord::Named namedFrom(const Json& object) {
+RunRecord::Named namedFrom(const OrderedJson& object) {
   RunRecord::Named facts;
   for (const auto& [name, value] : object.items()) facts.emplace_back(name, value.get<uint64_t>());
   return facts;
@@ -40,12 +40,12 @@ RunRecord::Named namedFrom(const Json& object) {
 RunOutcome outcomeFrom(const std::string& name) {
   const auto* const found = std::find(std::begin(kOutcomes), std::end(kOutcomes), name);
   if (found == std::end(kOutcomes))
-    throw Json::other_error::create(501, "unknown outcome", nullptr);
+    throw OrderedJson::other_error::create(501, "unknown outcome", nullptr);
   return static_cast<RunOutcome>(found - std::begin(kOutcomes));
 }
 
 // Throws where a member is missing or of the wrong kind.
-RunRecord recordFrom(const Json& json) {
+RunRecord recordFrom(const OrderedJson& json) {
   RunRecord record;
   record.start = Date{std::chrono::microseconds{json.at("start").get<int64_t>()}};
   record.end = Date{std::chrono::microseconds{json.at("end").get<int64_t>()}};
@@ -80,7 +80,7 @@ uint64_t RunRecord::rowsExpected() const {
 bool RunRecord::rowsBalance() const { return rowsStored == rowsExpected(); }
 
 std::optional<std::string> RunRecord::write(const std::string& stateDirectory) const {
-  Json json;
+  OrderedJson json;
   json["start"] = microseconds(start);
   json["end"] = microseconds(end);
   json["outcome"] = runOutcomeName(outcome);
@@ -96,7 +96,7 @@ std::optional<std::string> RunRecord::write(const std::string& stateDirectory) c
   json["store"] = named(store);
   json["marker"] = marker;
   // Words of the system are not always UTF-8.
-  const std::string text = json.dump(1, ' ', false, Json::error_handler_t::replace);
+  const std::string text = json.dump(1, ' ', false, OrderedJson::error_handler_t::replace);
   return replaceFileDurably(recordPath(stateDirectory), text + "\n");
 }
 
@@ -106,7 +106,7 @@ std::optional<RunRecord> RunRecord::read(const std::string& stateDirectory) {
   file.read(text.data(), static_cast<std::streamsize>(text.size()));
   text.resize(static_cast<size_t>(file.gcount()));
   try {
-    return recordFrom(Json::parse(text));
+    return recordFrom(OrderedJson::parse(text));
   } catch (const nlohmann::json::exception&) {
     return {};
   }

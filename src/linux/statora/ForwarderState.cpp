@@ -15,7 +15,7 @@ namespace tessel {
 namespace {
 
 // The forwarder has time; the service goes first.
-constexpr int kPatienceMilliseconds = 5000;
+constexpr int kForwardersPatience = 5000;  // milliseconds
 
 // Few enough that the service, whose next send may come at any moment, has no need to wait.
 constexpr size_t kRowsRemovedAtOnce = 128;
@@ -110,7 +110,7 @@ SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   }
   SqliteStatus status = database_.open(path_, mode);
   if (!status.ok()) return status;
-  database_.setBusyTimeout(kPatienceMilliseconds);
+  database_.setBusyTimeout(kForwardersPatience);
   const auto version = database_.integer("PRAGMA user_version");
   if (!version) return database_.status();
   if (*version != kSpoolSchemaVersion) {

@@ -2,9 +2,7 @@
 
 #include "linux/statora/Spool.h"
 
-#include <fcntl.h>
 #include <sqlite3.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
@@ -13,7 +11,7 @@
 #include <numeric>
 #include <utility>
 
-#include "linux/UniqueFd.h"
+#include "linux/DurableFile.h"
 #include "linux/statora/SpoolDatabase.h"
 #include "platform/Log.h"
 
@@ -56,11 +54,6 @@ bool renameAll(const std::string& from, const std::string& to) {
     if (error && error != std::errc::no_such_file_or_directory) return false;
   }
   return true;
-}
-
-void flushDirectory(const std::string& path) {
-  const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (directory.valid()) fsync(directory.get());
 }
 
 }  // namespace

@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "linux/Files.h"
+#include "linux/PlainText.h"
 
 namespace tessel {
 
@@ -76,12 +77,6 @@ class Variables {
   const EnvironmentReader& environment_;
   std::optional<LaunchError> error_;
 };
-
-std::string_view trimmed(std::string_view text) {
-  const size_t begin = text.find_first_not_of(" \t\r\n");
-  if (begin == std::string_view::npos) return {};
-  return text.substr(begin, text.find_last_not_of(" \t\r\n") - begin + 1);
-}
 
 // `text` with %XX decoded; nothing where that yields what a header cannot hold.
 std::optional<std::string> headerText(std::string_view text) {

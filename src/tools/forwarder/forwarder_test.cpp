@@ -142,15 +142,6 @@ TEST_F(ForwarderTest, ACollectorThatRefusesRecordAfterRecordIsHeldUp) {
   EXPECT_EQ(waiting(), 8);
 }
 
-TEST_F(ForwarderTest, AnAnswerAboutAddressOrCredentialsSetsNothingAside) {
-  send(3);
-  refuse({1}, 401);
-  EXPECT_EQ(deliver(), ForwarderOutcome::held);
-  EXPECT_THAT(collector_.bodies, SizeIs(1));
-  EXPECT_EQ(setAside(), 0);
-  EXPECT_EQ(waiting(), 3);
-}
-
 TEST_F(ForwarderTest, WaitsGrowUntilItGivesUpAndTheSameIsSentEachTime) {
   send(3);
   collector_.answer = [](const std::string&) { return ScriptedCollector::withStatus(503); };

@@ -74,6 +74,8 @@ TEST(ForwarderSettingsTest, WhatMakesNoSenseIsNamedAndSecretsAreNot) {
       {"OTEL_EXPORTER_OTLP_ENDPOINT", ""},
       {"OTEL_EXPORTER_OTLP_ENDPOINT", "collector"},
       {"OTEL_EXPORTER_OTLP_ENDPOINT", "http://127.0.0.1.example"},
+      {"OTEL_EXPORTER_OTLP_COMPRESSION", "brotli"},
+      {"TESSEL_FORWARD_RATE", "-1"},
       {"OTEL_EXPORTER_OTLP_ENDPOINT", "file:///etc/passwd"},
       {"OTEL_EXPORTER_OTLP_HEADERS", "hidden"},
       {"OTEL_EXPORTER_OTLP_HEADERS", "hidden=a%0d%0ab: c"},

@@ -34,7 +34,7 @@ struct EventsOptions {
   bool json = false;
 };
 
-constexpr std::chrono::milliseconds kLookInterval{200};
+constexpr std::chrono::milliseconds kLookForRowsEvery{200};
 
 // What a payload says about itself.
 Json parsed(std::string_view payload) { return Json::parse(payload, nullptr, false); }
@@ -52,9 +52,9 @@ bool matches(const std::vector<std::string>& patterns, const std::string& text) 
   return false;
 }
 
-class Selection {
+class RowSelection {
  public:
-  Selection(const EventsOptions& options, std::optional<Period> period)
+  RowSelection(const EventsOptions& options, std::optional<Period> period)
       : options_(options), period_(period) {}
 
   bool wants(const SpoolRow& row) const {
@@ -111,13 +111,13 @@ std::string shownName(std::string_view name) {
   return terminalText(name);
 }
 
-constexpr size_t kNameWidth = 24;
+constexpr size_t kEventWidth = 24;
 
 std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
-  std::string name = shortened(shownName(row.name), kNameWidth);
-  name.append(kNameWidth - std::min(kNameWidth, displayWidth(name)), ' ');
+  std::string name = shortened(shownName(row.name), kEventWidth);
+  name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
   const std::string time = dateText(Date{std::chrono::microseconds{row.time}}).substr(5);
-  const size_t used = time.size() + 2 + kNameWidth + 2;
+  const size_t used = time.size() + 2 + kEventWidth + 2;
   const std::string payload = cutOff(glance(parsed(row.payload), row.payload),
                                      terminal.width - std::min(used, terminal.width - 1));
   return terminal.paint(Colour::faint, time) + "  " + name + "  " + payload + "\n";
@@ -184,7 +184,7 @@ class EventsRun {
   int follow() {
     followed_ = true;
     for (;;) {
-      std::this_thread::sleep_for(kLookInterval);
+      std::this_thread::sleep_for(kLookForRowsEvery);
       const SpoolReader::State state = spool_.open();
       if (state == SpoolReader::State::noAccess) return complain(state);
       // A damaged spool is about to be set aside, an absent one to be made.
@@ -193,7 +193,7 @@ class EventsRun {
   }
 
   const EventsOptions& options_;
-  const Selection selection_;
+  const RowSelection selection_;
   SpoolReader& spool_;
   const Terminal terminal_;
   bool followed_ = false;
@@ -214,7 +214,7 @@ int runEvents(const EventsOptions& options) {
   return EventsRun(options, period, spool).list();
 }
 
-constexpr char kFooter[] =
+constexpr char kEventsFooter[] =
     "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event sent, "
     "in\n"
     "order. '~' stands for 'com.vantor.performance.'. Patterns may hold * and ?.\n\n"
@@ -243,7 +243,7 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
       ->type_name("COUNT");
   command->add_flag("--follow", options->follow, "Go on with what is sent from now on");
   command->add_flag("--json", options->json, "One JSON object a line: id, time, name, payload");
-  command->footer(kFooter);
+  command->footer(kEventsFooter);
   command->callback([&invocation, options] { invocation.status = runEvents(*options); });
 }
 

@@ -39,9 +39,9 @@ struct ExplainOptions {
 };
 
 // Which trace objects are shown.
-class Selection {
+class ObjectSelection {
  public:
-  explicit Selection(const ExplainOptions& options) : options_(options) {}
+  explicit ObjectSelection(const ExplainOptions& options) : options_(options) {}
 
   bool wants(const TesselObject& object, TesselReporterClassification verdict) const {
     return matches(options_.subsystems, object.subsystem()) &&
@@ -252,7 +252,7 @@ class ExplainRun {
 
   const ExplainOptions& options_;
   const Reading& reading_;
-  const Selection selection_;
+  const ObjectSelection selection_;
   JudgingFilter judge_;
   Tally tally_;
   const Terminal terminal_;
@@ -274,7 +274,7 @@ int runExplain(const ExplainOptions& options) {
   return ExplainRun(options, *reading).explain();
 }
 
-constexpr char kFooter[] =
+constexpr char kExplainFooter[] =
     "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at zero, "
     "as\n"
     "in a service that has just started. Without a period the last 24 hours are read, as in a "
@@ -314,7 +314,7 @@ void addExplainCommand(CLI::App& app, Invocation& invocation) {
   command->add_flag("--summary", options->summary, "Show figures instead of trace points");
   command->add_flag("--follow", options->follow, "Go on with what is recorded from now on");
   command->add_flag("--json", options->json, "One JSON object a line; with --summary one object");
-  command->footer(kFooter);
+  command->footer(kExplainFooter);
   command->callback([&invocation, options] { invocation.status = runExplain(*options); });
 }
 

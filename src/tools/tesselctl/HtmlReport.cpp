@@ -23,8 +23,8 @@ Html& Html::at(double value) {
 
 namespace {
 
-constexpr size_t kShownPairs = 40;
-constexpr size_t kShownMisses = 60;
+constexpr size_t kPairsOnPage = 40;
+constexpr size_t kMissesOnPage = 60;
 constexpr double kChartWidth = 1000;
 constexpr double kChartHeight = 200;
 
@@ -226,7 +226,7 @@ Html pairSection(const Tally& tally) {
           "class=\"n\">Objects</th>"
           "<th class=\"n\">Reported</th><th></th></tr>\n";
   const uint64_t most = pairs.empty() ? 1 : sumOf(pairs.front().counts);
-  for (size_t at = 0; at < std::min(pairs.size(), kShownPairs); ++at) {
+  for (size_t at = 0; at < std::min(pairs.size(), kPairsOnPage); ++at) {
     const Tally::Pair& pair = pairs[at];
     const uint64_t total = sumOf(pair.counts);
     html << "<tr><td class=\"name\">" << pair.subsystem << " <span class=\"soft\">/ "
@@ -239,8 +239,8 @@ Html pairSection(const Tally& tally) {
          << bar(pair.counts, ratio(total, most) * kChartWidth) << "</svg></td></tr>\n";
   }
   html << "</table></div>\n";
-  if (pairs.size() > kShownPairs) {
-    html << "<p class=\"soft\">... and " << grouped(pairs.size() - kShownPairs) << " more</p>\n";
+  if (pairs.size() > kPairsOnPage) {
+    html << "<p class=\"soft\">... and " << grouped(pairs.size() - kPairsOnPage) << " more</p>\n";
   }
   return html << legend(tally.verdicts()) << "</section>\n";
 }
@@ -255,7 +255,7 @@ Html missSection(const Tally& tally) {
           "<div class=\"scroll\"><table id=\"misses\"><tr><th "
           "class=\"n\">Times</th><th>Value</th><th>Trace point</th>"
           "<th class=\"n wide\">String</th></tr>\n";
-  for (size_t at = 0; at < std::min(misses.size(), kShownMisses); ++at) {
+  for (size_t at = 0; at < std::min(misses.size(), kMissesOnPage); ++at) {
     const Tally::Miss& miss = misses[at];
     html << "<tr><td class=\"n\">" << miss.count << "</td><td><code>"
          << shortened(replaceInvalidUtf8(miss.value), 80) << "</code></td><td class=\"name\">"
@@ -263,7 +263,7 @@ Html missSection(const Tally& tally) {
          << "</span></td><td class=\"n wide\">" << std::to_string(miss.slot) << "</td></tr>\n";
   }
   html << "</table></div>\n";
-  if (misses.size() > kShownMisses || tally.missesNotListed() != 0) {
+  if (misses.size() > kMissesOnPage || tally.missesNotListed() != 0) {
     html << "<p class=\"soft\">Further values are not listed here; <code>tesselctl explain "
             "--summary --json</code> "
             "lists them.</p>\n";

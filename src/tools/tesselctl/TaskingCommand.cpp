@@ -19,11 +19,12 @@ namespace tessel::ctl {
 
 namespace {
 
+using Json = nlohmann::ordered_json;
+
 constexpr unsigned kReadableByAll = 0644;  // the service runs as a user of its own
 
 // The configuration with its answer changed; what else it holds is kept.
 std::string changedConfiguration(const std::string& file, bool on) {
-  using Json = nlohmann::ordered_json;
   const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
   Json configuration = text ? Json::parse(*text, nullptr, false) : Json::object();
   if (!configuration.is_object()) configuration = Json::object();

@@ -131,11 +131,11 @@ std::optional<seconds> readZone(Scanner& scanner) {
   if (scanner.skip('Z')) return seconds{0};
   const int sign = scanner.peek() == '-' ? -1 : 1;
   if (!scanner.skip('+') && !scanner.skip('-')) return {};
-  const auto hours = scanner.number(2, 2);
+  const auto hour = scanner.number(2, 2);
   scanner.skip(':');
-  const auto minutes = scanner.number(2, 2);
-  if (!hours || !minutes || *hours > 14 || *minutes > 59) return {};
-  return sign * (std::chrono::hours{*hours} + std::chrono::minutes{*minutes});
+  const auto minute = scanner.number(2, 2);
+  if (!hour || !minute || *hour > 14 || *minute > 59) return {};
+  return sign * (std::chrono::hours{*hour} + std::chrono::minutes{*minute});
 }
 
 std::optional<Date> parseCalendar(std::string_view text, Date now) {
