@@ -150,49 +150,46 @@ TEST_F(ObjectFilterTest, ADecisionNamesWhatDecided) {
   EXPECT_FALSE(decision.shouldReport());
 }
 
-struct PerfLoggingCase {
-  const char* component;
-  const char* action;
-  bool passes;
-  int failingSlot;
-};
+TestPoint perfLoggingPoint(TestPoint::Text component, TestPoint::Text action) {
+  TestPoint point;
+  point.subsystem = "com.vantor.PerformanceAnalysis";
+  point.category = "PerfLogging";
+  point.name = "PerfLoggingOperation";
+  point.string1Value = std::move(component);
+  point.string2Value = std::move(action);
+  return point;
+}
 
 TEST_F(ObjectFilterTest, QuarroHasARuleOfItsOwnOnEveryBuild) {
-  const PerfLoggingCase cases[] = {{"ApplicationWindow", "Open", true, 0},
-                                   {"Open", "ApplicationWindow", false, 1},
-                                   {"ApplicationWindow", "Ajar", false, 2},
-                                   {"ApplicationWindow", nullptr, false, 2},
-                                   {nullptr, "Open", false, 1}};
+  const struct {
+    TestPoint::Text component, action;
+    int failingSlot;  // 0 where it passes
+  } cases[] = {{"ApplicationWindow", "Open", 0},
+               {"Open", "ApplicationWindow", 1},
+               {"ApplicationWindow", "Ajar", 2},
+               {"ApplicationWindow", {}, 2},
+               {{}, "Open", 1}};
   for (const bool internal : {false, true}) {
     variant.internal = internal;
     const auto quarro = makeFilter(Platform::quarro);
     for (const auto& row : cases) {
       const testing::RecordingLog log;
-      TestPoint point;
-      point.subsystem = "com.vantor.PerformanceAnalysis";
-      point.category = "PerfLogging";
-      point.name = "PerfLoggingOperation";
-      if (row.component) point.string1Value = row.component;
-      if (row.action) point.string2Value = row.action;
-      const auto decision = quarro->inspectTesselObject(*makeEvent(point));
-      EXPECT_EQ(decision.shouldReport(), row.passes) << internal << row.failingSlot;
+      const auto decision =
+          quarro->inspectTesselObject(*makeEvent(perfLoggingPoint(row.component, row.action)));
+      const bool passes = row.failingSlot == 0;
+      EXPECT_EQ(decision.shouldReport(), passes) << internal << row.failingSlot;
       EXPECT_EQ(decision.stringSlot, row.failingSlot);
-      EXPECT_EQ(decision.specialRule, !row.passes);
+      EXPECT_EQ(decision.specialRule, !passes);
       // Where the rule fails the object, nobody asks which whitelist mode is on.
-      EXPECT_EQ(log.lines().size(), row.passes ? 1u : 0u);
+      EXPECT_EQ(log.lines().size(), passes ? 1u : 0u);
     }
   }
 }
 
 TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
-  TestPoint point;
-  point.subsystem = "com.vantor.PerformanceAnalysis";
-  point.category = "PerfLogging";
-  point.name = "PerfLoggingOperation";
+  TestPoint point = perfLoggingPoint("ApplicationWindow", "Open");
   point.string1Name = "component";
-  point.string1Value = "ApplicationWindow";
   point.string2Name = "action";
-  point.string2Value = "Open";
   EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
   // On another platform it is an object like any other, and these are no values of that platform.
   EXPECT_FALSE(filter->shouldReportTesselObject(*makeEvent(point), nullptr));
@@ -203,9 +200,8 @@ TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
 }
 
 TEST_F(ObjectFilterTest, ASlotIsTestedOnlyWhereItIsLabelled) {
-  using Text = TestPoint::Text;
   const struct {
-    Text label1, value1, label2, value2;
+    TestPoint::Text label1, value1, label2, value2;
     bool passes;
   } cases[] = {{{}, {}, {}, {}, true},
                {{}, "anything", {}, "anything", true},
@@ -241,39 +237,6 @@ TEST_F(ObjectFilterTest, TheBuildVariantIsAskedForEveryObjectThatGetsThere) {
   EXPECT_EQ(log.count("Defaulting to using string whitelist"), 3u);
 }
 
-using MakeObject = std::function<std::shared_ptr<const TesselObject>(const TestPoint&)>;
-
-TEST_F(ObjectFilterTest, CountsEachKindOnce) {
-  const struct {
-    MakeObject make;
-    uint64_t (TesselReporterObjectFilter::*reported)() const;
-    uint64_t (TesselReporterObjectFilter::*unreported)() const;
-    uint64_t reportedEvents;
-  } kinds[] = {
-      {makeEvent, &TesselReporterObjectFilter::totalReportedEventCount,
-       &TesselReporterObjectFilter::totalUnreportedEventCount, 2},
-      {makeInterval, &TesselReporterObjectFilter::totalReportedIntervalCount,
-       &TesselReporterObjectFilter::totalUnreportedIntervalCount, 0},
-      {makeAnimationInterval, &TesselReporterObjectFilter::totalReportedAnimationCount,
-       &TesselReporterObjectFilter::totalUnreportedAnimationCount, 0},
-  };
-  for (const auto& kind : kinds) {
-    filter = makeFilter(Platform::selvin);
-    TestPoint point;
-    filter->inspectTesselObject(*kind.make(point));
-    filter->inspectTesselObject(*kind.make(point));
-    point.telemetryEnabled = false;
-    filter->inspectTesselObject(*kind.make(point));
-    EXPECT_EQ((*filter.*kind.reported)(), 2u);
-    EXPECT_EQ((*filter.*kind.unreported)(), 1u);
-    EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(), kind.reportedEvents);
-    EXPECT_EQ(filter->totalReportedEventCount() + filter->totalUnreportedEventCount() +
-                  filter->totalReportedIntervalCount() + filter->totalUnreportedIntervalCount() +
-                  filter->totalReportedAnimationCount() + filter->totalUnreportedAnimationCount(),
-              3u);
-  }
-}
-
 TEST_F(ObjectFilterTest, ACodeOutsideTheEnumerationIsInspectedAndNotReported) {
   filter->incrementTotalForObject(*makeInterval({}), static_cast<TesselReporterClassification>(6));
   EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), 1u);
@@ -291,26 +254,35 @@ std::vector<const TesselReporterAggregation*> perClassification(
           &filter.telemetryNotReportedClassNotSupportedAggregation()};
 }
 
-TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderExactlyOneReason) {
-  std::mt19937 random(20261122);
+// An object of one of the kinds, right or wrong in one way or several.
+TestPoint anyPoint(std::mt19937& random) {
   const auto chance = [&random](unsigned in) { return random() % in == 0; };
+  TestPoint point;
+  point.subsystem = "com.vantor.S" + std::to_string(random() % 5);
+  if (chance(7)) point.subsystem = "com.vantor.TextInput";
+  point.category = "C" + std::to_string(random() % 3);
+  if (chance(20)) point.category = {};
+  point.telemetryEnabled = !chance(5);
+  point.durationSeconds = chance(5) ? -1.0F : 1.0F;
+  if (chance(2)) {
+    point.string1Name = "period";
+    point.string1Value = chance(3) ? "never" : "day";
+  }
+  return point;
+}
+
+TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderItsReasonAndItsKind) {
+  const std::function<std::shared_ptr<const TesselObject>(const TestPoint&)> makers[] = {
+      makeEvent, makeInterval, makeAnimationInterval, makeObject};
+  std::mt19937 random(20261122);
   uint64_t expected[6] = {};
+  uint64_t ofKind[4][2] = {};
   constexpr uint64_t kCalls = 5000;
   for (uint64_t i = 0; i < kCalls; ++i) {
-    TestPoint point;
-    point.subsystem = "com.vantor.S" + std::to_string(random() % 5);
-    if (chance(7)) point.subsystem = "com.vantor.TextInput";
-    point.category = "C" + std::to_string(random() % 3);
-    if (chance(20)) point.category = {};
-    point.telemetryEnabled = !chance(5);
-    point.durationSeconds = chance(5) ? -1.0F : 1.0F;
-    if (chance(2)) {
-      point.string1Name = "period";
-      point.string1Value = chance(3) ? "never" : "day";
-    }
-    const MakeObject makers[] = {makeObject, makeEvent, makeInterval, makeAnimationInterval};
-    const FilterDecision decision = filter->inspectTesselObject(*makers[random() % 4](point));
+    const size_t kind = random() % 4;
+    const FilterDecision decision = filter->inspectTesselObject(*makers[kind](anyPoint(random)));
     ++expected[decision.classification];
+    ++ofKind[kind][decision.shouldReport()];
   }
   const auto aggregations = perClassification(*filter);
   for (size_t code = 0; code < aggregations.size(); ++code) {
@@ -321,11 +293,13 @@ TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderExactlyOneReason) {
     EXPECT_EQ(sum, expected[code]);
   }
   EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), kCalls);
-  EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(),
-            filter->totalReportedEventCount());
-  EXPECT_EQ(filter->totalReportedEventCount() + filter->totalReportedIntervalCount() +
-                filter->totalReportedAnimationCount(),
-            filter->telemetryReportedAggregation().totalCount());
+  EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(), ofKind[0][true]);
+  EXPECT_EQ(filter->totalReportedEventCount(), ofKind[0][true]);
+  EXPECT_EQ(filter->totalUnreportedEventCount(), ofKind[0][false]);
+  EXPECT_EQ(filter->totalReportedIntervalCount(), ofKind[1][true]);
+  EXPECT_EQ(filter->totalUnreportedIntervalCount(), ofKind[1][false]);
+  EXPECT_EQ(filter->totalReportedAnimationCount(), ofKind[2][true]);
+  EXPECT_EQ(filter->totalUnreportedAnimationCount(), ofKind[2][false]);
 }
 
 TEST_F(ObjectFilterTest, APlatformMakesTheFilter) {
