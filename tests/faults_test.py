@@ -15,9 +15,9 @@ import time
 import unittest
 
 import harness
-from harness import BIN, MachineTest, in_namespace_argv, interrupt, log_event, point
-from faults.fault_machine import (BAILED, STATISTICS, STEPS, FaultMachine, Watcher, is_subsequence, some_points,
-                                  stable)
+from harness import (BIN, STATISTICS, MachineTest, in_namespace_argv, interrupt, log_event, point, some_points,
+                     wait_for)
+from faults.fault_machine import BAILED, STEPS, FaultMachine, Watcher, is_subsequence
 
 ALL = os.environ.get("TESSEL_FAULTS") == "all"
 RANDOM_KILLS = int(os.environ.get("TESSEL_RANDOM_KILLS", "5"))
@@ -31,14 +31,6 @@ def sampled(count):
     if ALL or count <= SAMPLE:
         return list(numbers)
     return sorted({1, 2, 3, count, *random.Random(count).sample(numbers, SAMPLE)})
-
-
-def wait_for(condition, seconds=60):
-    deadline = time.monotonic() + seconds
-    while not condition():
-        if time.monotonic() > deadline:
-            raise AssertionError("timed out")
-        time.sleep(0.005)
 
 
 def each(machine_points, cases, check):

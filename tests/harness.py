@@ -21,6 +21,7 @@ SANITIZED = bool(os.environ.get("TESSEL_SANITIZE"))
 REMOTE = "/lib/systemd/systemd-journal-remote"
 SKIPPED = 77  # exit status that the test runner reads as "skipped"
 MARKER = "tessel_reporter_running"
+STATISTICS = "com.vantor.performance.tessel_reporting_stats"  # the last row of a run
 DEFAULT_BOOT = "5f2b1c0d9e8a47b6a1d2c3e4f5061728"
 TASKING = "com.vantor.performance.tessel_reporter_tasking.json"
 
@@ -49,6 +50,10 @@ def point(kind, subsystem, category, name=None, *, telemetry=True, string1=None,
             fields += [(f"TESSEL_{slot}_NAME", pair[0]), (f"TESSEL_{slot}_VALUE", pair[1])]
     fields += [("TESSEL_ATTRIBUTE", f"{key}={value}") for key, value in attributes]
     return Entry([(key, str(value)) for key, value in fields if value is not None], **entry)
+
+
+def some_points(count):
+    return [point("event", "com.vantor.Calendar", "View", f"Open{i}", at=-600 + i * 0.01) for i in range(count)]
 
 
 def log_event(text, **entry):
@@ -222,6 +227,14 @@ class MachineTest(unittest.TestCase):
 
     def assert_clean(self, result):
         self.assertEqual(result.status, 0, result.errors)
+
+
+def wait_for(condition, seconds=60):
+    deadline = time.monotonic() + seconds
+    while not condition():
+        if time.monotonic() > deadline:
+            raise AssertionError("timed out")
+        time.sleep(0.005)
 
 
 def interrupt(process):

@@ -106,15 +106,6 @@ class MixedDay(MachineTest):
         self.assert_clean(self.machine.run())
         self.assert_rows(self.expected())
 
-    def test_several_files_in_the_journals_own_order(self):
-        third = len(self.entries) // 3
-        for number in range(3):
-            part = self.entries[number * third:(number + 1) * third if number < 2 else None]
-            self.machine.write_export(part, f"{number}.export", first_sequence=1 + number * third)
-        self.assert_clean(self.machine.run())
-        self.assert_rows(self.expected())
-
-
 class NotTasked(MachineTest):
     def test_without_a_configuration_it_waits_sends_nothing_and_leaves_nothing(self):
         self.machine = harness.Machine()
@@ -126,20 +117,6 @@ class NotTasked(MachineTest):
                                       "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"])
         self.assertEqual(self.machine.rows(), [])
         self.assertFalse(self.machine.marker_exists())
-
-    def test_every_configuration_that_is_no_yes_is_a_no(self):
-        nil = "Not reporting based on not being tasked-on by Statora (nil configuration object)"
-        for text, line in (("{", nil), ("{}", "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"),
-                           ("[1]", "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration object)"),
-                           ('{"TaskedOn": "true"}', "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"),
-                           ('{"TaskedOn": 0}', "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"),
-                           ("[" * 100000, nil), ('{"TaskedOn": true, "x": "' + "y" * (1 << 20) + '"}', nil)):
-            self.machine.task(text)
-            result = self.machine.run()
-            self.assert_clean(result)
-            self.assertEqual(result.log, ["Checking in", line], text[:40])
-            self.assertEqual(self.machine.rows(), [])
-
 
 if __name__ == "__main__":
     harness.main()

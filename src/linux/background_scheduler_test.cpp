@@ -7,7 +7,6 @@
 #include <sys/stat.h>
 
 #include <filesystem>
-#include <mutex>
 #include <stdexcept>
 #include <thread>
 
@@ -240,25 +239,6 @@ struct SignallingStatus final : ServiceStatus {
   void progress() override {}
   Semaphore waitsForOther{0};
 };
-
-TEST_F(ActivityDeliveriesTest, ASecondProcessGetsItsRunWhenTheFirstIsDone) {
-  SignallingStatus status;
-  std::mutex mutex;
-  std::vector<std::string> order;
-  const auto note = [&](const char* what) {
-    const std::lock_guard lock(mutex);
-    order.emplace_back(what);
-  };
-  std::optional<RunLock> first = state_.tryLock();
-  ActivityDeliveries second({}, state_, conditions_, status, clock_,
-                            [&](const std::shared_ptr<Activity>&) { note("second runs"); });
-  std::thread thread([&] { second.deliverRun(); });
-  EXPECT_TRUE(status.waitsForOther.waitFor(seconds{30}));
-  note("first done");
-  first.reset();
-  thread.join();
-  EXPECT_THAT(order, ElementsAre("first done", "second runs"));
-}
 
 TEST_F(ActivityDeliveriesTest, ASecondProcessWithAnIntervalDoesNotRepeatTheRunOfTheFirst) {
   SignallingStatus status;

@@ -323,14 +323,6 @@ TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
   EXPECT_EQ(log.count(line), 2u);
 }
 
-TEST_F(ReportingRunTest, EventsLeaveAlsoWhereNothingIsLogged) {
-  testing::RecordingLog quiet(LogLevel::error);
-  extractor->objects = {makeEvent(TestPoint{})};
-  perform();
-  EXPECT_EQ(sender.events.size(), 2u + 3u + 1u);
-  EXPECT_TRUE(quiet.lines().empty());
-}
-
 class ReporterActivityTest : public ReportingRunTest {
  protected:
   void handle() { handler.handleActivity(activity); }

@@ -202,18 +202,5 @@ TEST(StringWhitelistTest, APerfLoggingOperationIsKnownByAllThreeStrings) {
   }
 }
 
-TEST(StringWhitelistTest, ComponentAndActionAreNotInterchangeable) {
-  EXPECT_EQ(perfLoggingComponentSet().size(), 70u);
-  EXPECT_EQ(perfLoggingActionSet().size(), 69u);
-  const SharedString component(perfLoggingComponentNames().back());
-  const SharedString action(perfLoggingActionNames().back());
-  EXPECT_TRUE(perfLoggingOperationStringsPass(component, action));
-  EXPECT_FALSE(perfLoggingOperationStringsPass(action, component));
-  EXPECT_FALSE(perfLoggingOperationStringsPass(component, component));
-  EXPECT_FALSE(perfLoggingOperationStringsPass(action, action));
-  EXPECT_FALSE(perfLoggingOperationStringsPass({}, action));
-  EXPECT_FALSE(perfLoggingOperationStringsPass(component, {}));
-}
-
 }  // namespace
 }  // namespace tessel

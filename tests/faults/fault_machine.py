@@ -9,10 +9,9 @@ import threading
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
 
-from harness import BIN, Machine, point  # noqa: E402
+from harness import BIN, Machine  # noqa: E402
 
 SHIM = os.path.join(BIN, "fault_shim.so")
-STATISTICS = "com.vantor.performance.tessel_reporting_stats"
 BAILED = "Bailing due to cookie file"
 # Each step of a run by a line that the log has for it, and whether the run marker is there then.
 STEPS = [("Checking in", False), ("Reporting based on being tasked-on", False), ("Created cookie file", True),
@@ -20,10 +19,6 @@ STEPS = [("Checking in", False), ("Reporting based on being tasked-on", False), 
          ("Sleeping for", True), ("Total tessel object count", True), ("(Count reported to Statora)", True),
          ("String whitelist filtered tessel object count", True), ("Done processing", True), ("Throttled", True),
          ("Cleared cookie file", False)]
-
-
-def some_points(count):
-    return [point("event", "com.vantor.Calendar", "View", f"Open{i}", at=-600 + i * 0.01) for i in range(count)]
 
 
 def stable(rows):
