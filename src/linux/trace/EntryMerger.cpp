@@ -26,9 +26,8 @@ bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
 }
 
 void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
-  if (!stream->next()) return;
-  const EntryHeader* header = &stream->header();
-  heap_.push_back({std::move(stream), header, number, 0});
+  Source source{std::move(stream), nullptr, number, 0};
+  if (source.next()) heap_.push_back(std::move(source));
 }
 
 bool EntryMerger::next() {
@@ -46,7 +45,7 @@ bool EntryMerger::next() {
 
 // Most entries are followed by one of the same stream; then nothing moves.
 void EntryMerger::advanceFirst() {
-  const bool more = heap_.front().stream->next();
+  const bool more = heap_.front().next();
   if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
       [[likely]]
     return;
@@ -88,7 +87,7 @@ void EntryMerger::dropDuplicates() {
     }
     heap_[child].droppedAt = current_;
     ++duplicates_;
-    if (!heap_[child].stream->next()) close(child);
+    if (!heap_[child].next()) close(child);
     siftDown(child);
     runnerUp_ = findRunnerUp();
   }

@@ -32,7 +32,7 @@ class EntryMerger final : public EntryStream {
   EntryMerger(const StopFlag& stop, uint64_t& duplicates) : stop_(stop), duplicates_(duplicates) {}
 
   // Adds a stream; it is asked for its first entry at once, and closed after its last.
-  // REQUIRES: next() was not called; the stream's header() is one object for all entries.
+  // REQUIRES: next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
   bool next() override;
@@ -43,8 +43,14 @@ class EntryMerger final : public EntryStream {
 
  private:
   struct Source {
+    bool next() {
+      if (!stream->next()) return false;
+      header = &stream->header();
+      return true;
+    }
+
     std::unique_ptr<EntryStream> stream;
-    const EntryHeader* header;
+    const EntryHeader* header;  // of its current entry
     uint32_t number;
     uint64_t droppedAt = 0;  // of the current entries, by count, the last that it lost a twin of
   };

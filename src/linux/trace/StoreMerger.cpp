@@ -13,18 +13,13 @@ class StoreMerger::Sequence final : public EntryStream {
     for (auto& [stream, number] : streams) merger_.add(std::move(stream), number);
   }
 
-  bool next() override {
-    if (!merger_.next()) return false;
-    header_ = merger_.header();
-    return true;
-  }
-  const EntryHeader& header() const override { return header_; }
+  bool next() override { return merger_.next(); }
+  const EntryHeader& header() const override { return merger_.header(); }
   Entry entry() override { return merger_.entry(); }
   uint32_t streamNumber() const { return merger_.streamNumber(); }
 
  private:
   EntryMerger merger_;
-  EntryHeader header_;
 };
 
 void StoreMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence) {
