@@ -150,6 +150,28 @@ TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
   EXPECT_TRUE(reading.report.reachesRangeStart());
 }
 
+TEST(TraceStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
+  const TemporaryDirectory directory;
+  JournalWriter system, user({.sequenceId = {9}});
+  for (uint64_t i = 1; i <= 40; ++i) {
+    EntryHeader header;
+    header.bootId = {1};
+    header.monotonic = 10 * i;
+    header.realtime = 1000 + i - (i > 20 ? 30 : 0);
+    system.add(header, {"PRIORITY=6"});
+    header.monotonic += 5;
+    if (i == 22) user.add(header, {"_UID=1000"});
+  }
+  const std::string a = directory.write("system.journal", system.bytes());
+  const std::string b = directory.write("user-1000.journal", user.bytes());
+  const Reading all = readStore(directory.path());
+  EXPECT_TRUE(all.entries == testing::readWithLibsystemd({a, b}));
+  EXPECT_EQ(all.entries.at(22).fields, std::vector<std::string>{"_UID=1000"});
+  EXPECT_EQ(numbers(readStore(directory.path(), {1005, 1008})),
+            (std::vector<uint64_t>{5, 6, 7, 35, 36, 37}));
+  EXPECT_EQ(numbers(readStore(a, {999, 1002})), (std::vector<uint64_t>{1, 29, 30, 31}));
+}
+
 TEST(TraceStoreTest, TellsGapsInTheSequence) {
   const TemporaryDirectory directory;
   directory.write("a.journal", someJournal(10, 1));
