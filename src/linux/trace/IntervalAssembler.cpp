@@ -93,7 +93,7 @@ void IntervalAssembler::emitEvent() {
 void IntervalAssembler::begin(const EntryHeader& header) {
   const size_t before = open_.size();
   const uint64_t droppedBefore = open_.dropped();
-  open_.open({keyOf(header), header.monotonic, point_.tokens, point_.attributes});
+  open_.open(keyOf(header), header.monotonic, point_.tokens, point_.attributes);
   if (open_.size() == before && open_.dropped() == droppedBefore) ++counts_.replacedBegins;
 }
 

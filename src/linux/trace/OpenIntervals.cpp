@@ -55,13 +55,18 @@ const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
   return node == kNone ? nullptr : &nodes_[node].interval;
 }
 
-void OpenIntervals::open(OpenInterval begin) {
-  const uint32_t hash = hashOf(begin.key);
-  const size_t slot = slotOf(begin.key, hash);
+void OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
+                         const std::vector<FieldToken>& attributes) {
+  const uint32_t hash = hashOf(key);
+  const size_t slot = slotOf(key, hash);
   if (slots_[slot].node != kNone) removeAt(slot);
-  attributes_ += begin.attributes.size();
+  attributes_ += attributes.size();
   const uint32_t node = newNode();
-  nodes_[node].interval = std::move(begin);
+  OpenInterval& interval = nodes_[node].interval;
+  interval.key = key;
+  interval.monotonic = monotonic;
+  interval.tokens = tokens;
+  interval.attributes = attributes;
   nodes_[node].hash = hash;
   link(node);
   if (++size_ * 2 > slots_.size()) grow();

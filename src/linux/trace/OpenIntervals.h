@@ -51,7 +51,8 @@ class OpenIntervals {
   explicit OpenIntervals(OpenIntervalLimits limits = {});
 
   // Opens an interval; one that is open under the same key is replaced and counts as the youngest.
-  void open(OpenInterval begin);
+  void open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
+            const std::vector<FieldToken>& attributes);
   // The open interval under `key`, or null; valid until the next call that is not const.
   const OpenInterval* find(const IntervalKey& key) const;
   // REQUIRES: `interval` was answered by find().
