@@ -178,17 +178,6 @@ class Periods(ExplainTest):
             self.assertEqual([line["name"] for line in self.explain(*arguments)],
                              [f"{hour}" for hour in reversed(hours) if hour in wanted], arguments)
 
-    def test_what_makes_no_sense_is_named_with_its_value(self):
-        self.machine.write_export([log_event("x")])
-        for arguments in (("--since", "soon"), ("--until", "2026-02-30"), ("--last", "24"), ("--last", "-1h"),
-                          ("--since", "25:00"), ("--platform", "quarro"), ("--verdict", "good"),
-                          ("--since", "tomorrow")):
-            result = self.machine.ctl("explain", *arguments)
-            self.assertEqual(result.status, 2, arguments)
-            self.assertIn(arguments[0], result.errors)
-            self.assertIn(f"'{arguments[1]}'", result.errors)
-        self.assertEqual(self.machine.ctl("explain", "--since", "-1h", "--until", "-2h").status, 2)
-
 
 class Follow(ExplainTest):
     def append(self, entries):
@@ -228,7 +217,6 @@ class Follow(ExplainTest):
         lines, _ = self.shown(process, 3)
         self.assertEqual([(line["name"], line["kind"]) for line in lines],
                          [("First", "Event"), ("Span", "Interval"), ("Twin", "Event")])
-
 
     LIVE = """
         "$0" explain --follow --json >"$1" & follower=$!

@@ -91,6 +91,7 @@ class Disk(FaultTest):
         stored, record = machine.stored(), machine.record()
         self.assertTrue(is_subsequence(stored, machine.expected), "only what was sent may be there")
         lost = sum(record["rows_failed"].values())
+        self.reasons |= {(error, reason) for reason, count in record["rows_failed"].items() if count}
         self.assertEqual(record["rows_stored"] + lost, len(machine.expected))
         # A row whose flush failed counts as lost, but may be found by the next to open the database.
         self.assertIn(len(stored) - record["rows_stored"], (0, 1), "what is called stored is there")
@@ -105,7 +106,10 @@ class Disk(FaultTest):
         self.assertGreater(calls, 30, "the library must see the spool's calls")
         cases = [(at, error, times) for error, times in ((errno.ENOSPC, 0), (errno.EIO, 0), (errno.EIO, 1),
                                                          (errno.ENOSPC, 1)) for at in sampled(calls)]
+        self.reasons = set()
         each(some_points(2), cases, self.check_spool)
+        self.assertIn((errno.ENOSPC, "disk_full"), self.reasons)
+        self.assertNotIn((errno.ENOSPC, "limit"), self.reasons)
 
     def test_the_other_files_of_the_state_may_fail_too(self):
         def check(machine, case):

@@ -120,18 +120,6 @@ class Odd(MachineTest):
     def test_from_a_journal_and_through_the_whitelist(self):
         self.run_odd(self.machine.write_journal, internal=False)
 
-    def test_nothing_raw_reaches_a_terminal_through_the_companion(self):
-        self.machine.write_export(self.entries())
-        self.machine.run()
-        for command in (["explain"], ["explain", "--json"], ["explain", "--json", "--payload"], ["explain", "--summary"],
-                        ["explain", "--summary", "--json"], ["events"], ["events", "--json"], ["status"]):
-            result = self.machine.ctl(*command)
-            if result.status == 64 or "not expected" in result.errors:
-                self.skipTest(f"there is no command {command[0]}")
-            with self.subTest(command=command):
-                self.assert_plain(result.out)
-                self.assert_plain(result.errors)
-
 
 if __name__ == "__main__":
     harness.main()

@@ -14,7 +14,7 @@ import harness
 from harness import BIN, TASKING, MachineTest, log_event, point
 from otlp_receiver import Answer, Receiver
 
-HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "two\nlines", "tab\tand\rreturn",
+HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "%s%n%llu", "two\nlines", "tab\tand\rreturn",
            "\x7fdelete", "caf\udce9", "\u2028separator"]
 # What no text of the outside may bring to a terminal, line feeds apart.
 OBEYED = re.compile("[\x00-\x09\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028\u2029\u202a-\u202e\u2066-\u2069\udc80-\udcff]")
@@ -65,7 +65,8 @@ class Statuses(CtlTest):
                 (("explain", "--store", "/nowhere"), 1, "/nowhere"), (("events",), 1, self.spool()),
                 (("report",), 2, "--html"), (("report", "--html", "/nowhere/x"), 1, "/nowhere/x"),
                 (("report", "--html", "-", "--last-run"), 1, self.machine.state),
-                (("compare", "usual", "unusual"), 2, "unusual"), (("defer",), 2, "subcommand"),
+                (("compare", "usual", "unusual"), 2, "unusual"), (("explain", "--platform", "quarro"), 2, "'quarro'"),
+                (("explain", "--verdict", "good"), 2, "'good'"), (("defer",), 2, "subcommand"),
                 (("explain", "--follow", "--summary"), 2, "--follow"), (("events", "--since", "soon"), 2, "'soon'")):
             if arguments[:1] != ("explain",) or "--store" not in arguments:
                 self.machine.write_export([log_event("x")])

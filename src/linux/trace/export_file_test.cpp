@@ -4,12 +4,11 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
-#include <filesystem>
 #include <fstream>
 #include <thread>
 
+#include "linux/testing/TemporaryDirectory.h"
 #include "linux/trace/ExportEntryStream.h"
 #include "linux/trace/TracePointTable.h"
 
@@ -18,16 +17,9 @@ namespace {
 
 class ExportFileTest : public ::testing::Test {
  protected:
-  ExportFileTest() {
-    char pattern[] = "/tmp/tessel-export-XXXXXX";
-    directory = ::mkdtemp(pattern);
-    origin = currentOrigin();
-  }
-  ~ExportFileTest() override { std::filesystem::remove_all(directory); }
-
-  std::string path() const { return directory + "/tessel.export"; }
+  std::string path() const { return directory.path("tessel.export"); }
   bool append(const std::string& name) {
-    return !appendToExportFile(directory, origin, {{"TESSEL_NAME", name}});
+    return !appendToExportFile(directory.path(), origin, {{"TESSEL_NAME", name}});
   }
   // The names in the file, in order; checks that the entries count up without a gap.
   std::vector<std::string> names() {
@@ -49,8 +41,8 @@ class ExportFileTest : public ::testing::Test {
     return all;
   }
 
-  std::string directory;
-  RecordOrigin origin;
+  testing::TemporaryDirectory directory;
+  RecordOrigin origin = currentOrigin();
   FileReport report;
 };
 

@@ -4,12 +4,12 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <chrono>
 #include <filesystem>
 #include <thread>
 
+#include "linux/testing/TemporaryDirectory.h"
 #include "linux/trace/EntryCursor.h"
 #include "linux/trace/ExportFile.h"
 #include "linux/trace/testing/FakeEntryStream.h"
@@ -171,8 +171,9 @@ TEST_F(JournalExtractorTest, aStopFromAnotherThreadTakesEffectWhereNothingIsDeli
 }
 
 TEST_F(JournalExtractorTest, aStoreOnDiskIsReadWithinTheRange) {
-  char pattern[] = "/tmp/tessel-extractor-XXXXXX";
-  const std::string store = ::mkdtemp(pattern);
+  const testing::TemporaryDirectory directory;
+  const std::string store = directory.path("store");
+  std::filesystem::create_directory(store);
   RecordOrigin origin = currentOrigin();
   for (const uint64_t time : {99u, 100u, 199u, 200u}) {
     origin.realtime = time;
