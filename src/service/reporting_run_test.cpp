@@ -249,6 +249,7 @@ TEST_F(ReportingRunTest, FivePairsOfASectionAreSentAndTheRestOnlyCounted) {
     if (event.name == "com.vantor.performance.tessel_counts") counts.push_back(event.json);
   }
   ASSERT_EQ(counts.size(), 5u);
+  EXPECT_EQ(status.steps, extractor->objects.size() + 7) << "each object and each pair is progress";
   EXPECT_EQ(reports.at(0).countEvents, 5u);
   EXPECT_EQ(
       counts[0],
@@ -282,6 +283,7 @@ TEST_F(ReportingRunTest, EachSectionStartsItsFiveAnew) {
                                         {"\"Classification\":\"Reported\"}", 5},
                                         {"\"Classification\":\"ReportedEvents\"}", 5},
                                         {"\"Classification\":\"DurationThresholdFiltered\"}", 5}}));
+  EXPECT_EQ(throttle.throttledCount(), 3u) << "each pair of a section is paced, sent or not";
 }
 
 TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {

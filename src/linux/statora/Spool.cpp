@@ -197,6 +197,7 @@ SpoolFailure Spool::classify(const SqliteStatus& status, size_t rowBytes) {
     default:
       return SpoolFailure::other;
   }
+  if (maxPages_ == 0) return SpoolFailure::diskFull;  // while it is opened, no limit is set yet
   if (logPages_ > maxLogPages_) return SpoolFailure::limit;
   // SQLite says "full" of its own page limit and of the disk alike. The row, its overflow pages and
   // the tree above it would not have fitted: then it was the limit.
