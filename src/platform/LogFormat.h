@@ -36,7 +36,7 @@ consteval LogArgumentKind kindOf() {
   } else if constexpr (!std::is_integral_v<Plain> || std::is_same_v<Plain, bool>) {
     return LogArgumentKind::none;
   } else if constexpr (sizeof(Plain) == 8) {
-    return std::is_unsigned_v<Plain> ? LogArgumentKind::unsigned64 : LogArgumentKind::signed64;
+    return std::is_unsigned<Plain>::value ? LogArgumentKind::unsigned64 : LogArgumentKind::signed64;
   } else {
     return std::is_same_v<Plain, uint32_t> ? LogArgumentKind::unsigned32 : LogArgumentKind::none;
   }

@@ -19,7 +19,7 @@ constexpr std::chrono::milliseconds kBetweenSteps{20};
 
 }  // namespace
 
-Forwarder::Forwarder(World world, OtlpBody body, ForwarderOptions options)
+Forwarder::Forwarder(World world, OtlpBody body, const ForwarderOptions& options)
     : world_(std::move(world)),
       body_(std::move(body)),
       options_(options),

@@ -57,7 +57,7 @@ class Forwarder {
     std::function<double()> chance;
   };
 
-  Forwarder(World world, OtlpBody body, ForwarderOptions options);
+  Forwarder(World world, OtlpBody body, const ForwarderOptions& options);
 
   // Delivers until nothing waits. REQUIRES: the state is open.
   ForwarderOutcome deliverAll();
