@@ -80,7 +80,7 @@ void decideKnownPairs(benchmark::State& state) {
       benchmark::DoNotOptimize(filter->shouldReportTesselObject(*object, nullptr));
     }
   }
-  state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * objects.size()));
+  state.SetItemsProcessed(state.iterations() * static_cast<int64_t>(objects.size()));
 }
 BENCHMARK(decideKnownPairs);
 
@@ -103,7 +103,7 @@ void decideNewPairs(benchmark::State& state) {
     filter.reset();
     state.ResumeTiming();
   }
-  state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * objects.size()));
+  state.SetItemsProcessed(state.iterations() * static_cast<int64_t>(objects.size()));
   // Every object is a reported event, so each pair stands in three aggregations.
   state.counters["bytes_per_pair"] =
       static_cast<double>(bytes) / static_cast<double>(objects.size());

@@ -35,7 +35,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   append(file, data, size);
   // A description of its own, with its own place in the file.
   const std::string path = "/proc/self/fd/" + std::to_string(file);
-  tessel::TracePointTable table({.fields = 64, .textBytes = 64 * 1024});
+  tessel::TracePointTable table({.fields = 64, .textBytes = size_t{64} << 10});
   tessel::StopFlag stop = false;
   tessel::FileReport report;
   tessel::WindowBudget windows;

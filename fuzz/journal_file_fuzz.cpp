@@ -1,5 +1,5 @@
-// Any bytes as a journal file. What is delivered must keep to the file's own limits: no entry twice,
-// no value beyond what is shown of one, an end.
+// Any bytes as a journal file. What is delivered must keep to the file's own limits: no entry
+// twice, no value beyond what is shown of one, an end.
 //
 // The tables of a real journal file are megabytes of zeros that the reader never looks at. An input
 // therefore begins with where such a stretch stands and how long it is, 32 bits each; the file is
@@ -76,7 +76,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const auto opened = readJournalHeader(file);
   const auto* beginning = std::get_if<JournalBeginning>(&opened);
   if (beginning == nullptr) return 0;
-  TracePointTable table({.fields = 64, .textBytes = 64 * 1024});
+  TracePointTable table({.fields = 64, .textBytes = size_t{64} << 10});
   StopFlag stop = false;
   FileReport report;
   const uint32_t number = nextNumber();

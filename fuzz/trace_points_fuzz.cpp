@@ -51,7 +51,7 @@ std::string_view takeLine(std::string_view& rest) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   std::string_view rest(reinterpret_cast<const char*>(data), size);
-  TracePointTable table({.fields = 48, .textBytes = 32 * 1024});
+  TracePointTable table({.fields = 48, .textBytes = size_t{32} << 10});
   KeepingSink sink;
   IntervalAssembler assembler(table, sink, {.intervals = 8, .attributes = 12});
   EntryHeader header;

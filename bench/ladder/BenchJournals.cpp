@@ -86,7 +86,7 @@ void Writer::writeLine(FILE* out, uint64_t index, unsigned service) {
 }  // namespace
 
 std::string makeJournals(const std::string& directory, const JournalSpec& spec) {
-  const std::string place = directory + "/" + spec.name;
+  std::string place = directory + "/" + spec.name;
   if (std::filesystem::exists(place + "/complete")) return place;
   std::filesystem::remove_all(place);
   std::filesystem::create_directories(place);

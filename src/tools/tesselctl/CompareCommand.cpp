@@ -76,6 +76,7 @@ struct Change {
   uint8_t slot = 0;
   std::string value;  // that the whitelist of the other side does not know
 
+  // NOLINTNEXTLINE(modernize-use-nullptr): the 0 is the compiler's own
   auto operator<=>(const Change&) const = default;
 };
 

@@ -160,7 +160,7 @@ std::optional<PlatformError> DryRun::follow(Date start,
   NewEntries news(microsecondsSince1970(start));
   while (!refused_) {
     news.beginLook();
-    const auto error = readOnce({news.start(), UINT64_MAX}, [&](EntryStream& entries) {
+    auto error = readOnce({news.start(), UINT64_MAX}, [&](EntryStream& entries) {
       NewEntryStream fresh(entries, news);
       extractor_.processEntries(fresh);
     });

@@ -138,7 +138,7 @@ Html verdictSection(const Tally& tally) {
 // The least round number that is not below `highest`.
 uint64_t roundTop(uint64_t highest) {
   for (uint64_t unit = 1;; unit *= 10) {
-    for (const uint64_t step : {1, 2, 3, 4, 5, 6, 8}) {
+    for (const uint64_t step : {1U, 2U, 3U, 4U, 5U, 6U, 8U}) {
       if (unit * step >= highest) return unit * step;
     }
   }

@@ -122,6 +122,7 @@ int exitStatusOf(int waitStatus) {
 // Runs the command to its end; what the terminal sends to both of us is for the command.
 int runCommand(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
+  arguments.reserve(command.size() + 1);
   for (const std::string& argument : command)
     arguments.push_back(const_cast<char*>(argument.c_str()));
   arguments.push_back(nullptr);

@@ -34,7 +34,7 @@ struct KindCounts {
 class Tally {
  public:
   static constexpr size_t kMaxMisses = 8192;
-  static constexpr size_t kMaxMissBytes = 2 * 1024 * 1024;
+  static constexpr size_t kMaxMissBytes = size_t{2} << 20;
   static constexpr size_t kMaxSlices = 48;
 
   // Trace objects of `period` are counted by slices of it as well.

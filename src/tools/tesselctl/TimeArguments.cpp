@@ -245,7 +245,7 @@ std::string durationText(microseconds duration) {
   if (whole < 60) return std::to_string(whole) + " s";
   if (whole < 3600) return std::to_string(whole / 60) + " min";
   const auto minutes = whole / 60 % 60;
-  if (whole < 2 * 86'400) {
+  if (whole < 172'800) {
     return std::to_string(whole / 3600) + " h" +
            (minutes == 0 ? "" : " " + std::to_string(minutes) + " min");
   }

@@ -20,10 +20,12 @@ TEST(ShownTextTest, NothingReachesATerminalThatItObeys) {
       {"a\nb\tc\r", "a\\x0ab\\x09c\\x0d"},
       {"\x7f", "\\x7f"},
       {"\xff\xc3", "\\xff\\xc3"},
+      // NOLINTNEXTLINE(misc-misleading-bidirectional): what must not reach a terminal
       {"\u202eabc\u2066", "\\u202eabc\\u2066"},
       {"\u2028", "\\u2028"},
   };
   for (const auto& [text, shown] : cases) EXPECT_EQ(terminalText(text), shown);
+  // NOLINTNEXTLINE(misc-misleading-bidirectional)
   EXPECT_EQ(terminalJson("{\"a\":\n\t\"\u009b\x7f\u202e\"}"),
             "{\"a\":  \"\\u009b\\u007f\\u202e\"}");
 }
@@ -31,6 +33,7 @@ TEST(ShownTextTest, NothingReachesATerminalThatItObeys) {
 TEST(ShownTextTest, NothingBecomesMarkup) {
   EXPECT_EQ(htmlText("<a href='x' title=\"y\">&amp;"),
             "&lt;a href=&#39;x&#39; title=&quot;y&quot;&gt;&amp;amp;");
+  // NOLINTNEXTLINE(misc-misleading-bidirectional)
   EXPECT_EQ(htmlText("\x1b\xff\u202e\u0085"), "&#9243;\ufffd\ufffd\ufffd");
 }
 
