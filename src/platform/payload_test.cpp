@@ -42,6 +42,7 @@ TEST(PayloadTest, TextIsEscapedAndInvalidUtf8Replaced) {
     const char* json;
   } cases[] = {
       {"a\"b\\c\n\x01", R"("a\"b\\c\n\u0001")"},
+      {"\b\f\r\t\x1f\x7f", R"("\b\f\r\t\u001f\u007f")"},
       {"gr\xc3\xbc\xc3\x9f", "\"gr\xc3\xbc\xc3\x9f\""},
       {"\xff|\xc3|\xe2\x82|\xed\xa0\x80|\xf0\x9f\x98\x80",
        "\"\xef\xbf\xbd|\xef\xbf\xbd|\xef\xbf\xbd|\xef\xbf\xbd\xef\xbf\xbd\xef\xbf\xbd|"
