@@ -182,7 +182,7 @@ class Periods(ExplainTest):
 class Follow(ExplainTest):
     def append(self, entries):
         with open(os.path.join(self.machine.store, "live.export"), "ab") as file:
-            file.write(export_bytes(entries, time.time(), first_sequence=self.sequence))
+            file.writelines(export_bytes(entries, time.time(), first_sequence=self.sequence))
         self.sequence += len(entries)
 
     def shown(self, process, count):
@@ -337,8 +337,9 @@ class Reading(ExplainTest):
     def test_a_damaged_file_is_named_and_the_rest_is_read(self):
         self.machine.write_export([point("event", "com.vantor.A", "B", "C")])
         with open(os.path.join(self.machine.store, "b.export"), "wb") as file:
-            file.write(b"no equals sign\n\n" + export_bytes([point("event", "com.vantor.D", "E", "F", at=-50)], self.machine.now,
-                                                            first_sequence=7))
+            file.write(b"no equals sign\n\n")
+            file.writelines(export_bytes([point("event", "com.vantor.D", "E", "F", at=-50)], self.machine.now,
+                                         first_sequence=7))
         with open(os.path.join(self.machine.store, "c.journal"), "wb") as file:
             file.write(b"LPKSHHRH" + b"\xff" * 4096)
         summary = self.summary()

@@ -7,6 +7,7 @@ that is installed here.
 import contextlib
 import json
 import os
+import re
 import shutil
 import signal
 import sqlite3
@@ -22,6 +23,7 @@ REMOTE = "/lib/systemd/systemd-journal-remote"
 SKIPPED = 77  # exit status that the test runner reads as "skipped"
 MARKER = "tessel_reporter_running"
 STATISTICS = "com.vantor.performance.tessel_reporting_stats"  # the last row of a run
+CONTROL = re.compile(rb"[\x00-\x1f]")
 DEFAULT_BOOT = "5f2b1c0d9e8a47b6a1d2c3e4f5061728"
 TASKING = "com.vantor.performance.tessel_reporter_tasking.json"
 
@@ -63,14 +65,13 @@ def log_event(text, **entry):
 
 def _field(name, value):
     data = value if isinstance(value, bytes) else value.encode("utf-8", "surrogateescape")
-    if b"\n" in data or any(byte < 32 for byte in data):
+    if CONTROL.search(data):
         return name.encode() + b"\n" + len(data).to_bytes(8, "little") + data + b"\n"
     return name.encode() + b"=" + data + b"\n"
 
 
 def export_bytes(entries, now, first_sequence=1):
-    """The entries in the Journal Export Format."""
-    out = []
+    """The entries in the Journal Export Format, entry by entry."""
     for number, entry in enumerate(entries, first_sequence):
         realtime = entry.realtime(now)
         cursor = f"s={'ab' * 16};i={number:x};b={entry.boot};m={entry.mono:x};t={realtime:x};x={number:x}"
@@ -78,8 +79,7 @@ def export_bytes(entries, now, first_sequence=1):
                 ("__MONOTONIC_TIMESTAMP", str(entry.mono)), ("_BOOT_ID", entry.boot)]
         trusted = [("_EXE", entry.exe), ("_COMM", entry.comm), ("_PID", str(entry.pid) if entry.pid else None)]
         fields = head + entry.fields + [pair for pair in trusted if pair[1] is not None]
-        out.append(b"".join(_field(key, value) for key, value in fields) + b"\n")
-    return b"".join(out)
+        yield b"".join(_field(key, value) for key, value in fields) + b"\n"
 
 
 def have(program):
@@ -123,7 +123,7 @@ class Machine:
 
     def write_export(self, entries, name="a.export", **kwargs):
         with open(os.path.join(self.store, name), "wb") as file:
-            file.write(export_bytes(entries, self.now, **kwargs))
+            file.writelines(export_bytes(entries, self.now, **kwargs))
 
     def write_journal(self, entries, name="a.journal", environment=None, **kwargs):
         """A journal file with the entries, made by systemd-journal-remote."""
@@ -133,7 +133,7 @@ class Machine:
         self.now = time.time()
         export = os.path.join(self.root, name + ".source")
         with open(export, "wb") as file:
-            file.write(export_bytes(entries, self.now, **kwargs))
+            file.writelines(export_bytes(entries, self.now, **kwargs))
         path = os.path.join(self.store, name)
         subprocess.run([REMOTE, "-o", path, export], check=True, capture_output=True,
                        env={**os.environ, **(environment or {})})

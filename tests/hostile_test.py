@@ -3,6 +3,7 @@
 
 TESSEL_HOSTILE_POINTS sets the size of the floods.
 """
+import itertools
 import json
 import os
 import re
@@ -22,12 +23,20 @@ ODD = ["\x1b[31mred\x1b[0m\x1b]0;title\x07", "\r\nerror: forged line\n", "%s%n%@
 TERMINAL = re.compile("[\x00-\x08\x0b-\x1f\x7f-\x9f]")
 
 
+def assert_plain(test, text):
+    found = TERMINAL.search(text)
+    test.assertIsNone(found, found and repr(text[max(0, found.start() - 40):found.end() + 40]))
+    test.assertEqual(text, text.encode("utf-8", "replace").decode("utf-8"), "well-formed throughout")
+
+
 class Flood(MachineTest):
     def run_flood(self, entries, **extra):
         self.machine.write_export(entries)
         cost = run_measured(self.machine, **extra)
         self.assertEqual(cost.status, 0, cost.stderr[-2000:])
-        print(f"{self.id().split('.')[-1]}: {len(entries)} entries, {cost.anonymous} KiB, {cost.seconds:.1f} s")
+        count = self.statistics()["LogObjectsProcessed"]
+        print(f"{self.id().split('.')[-1]}: {count} entries, {cost.anonymous} KiB, {cost.seconds:.1f} s, "
+              f"{cost.processor_seconds:.1f} s of a processor")
         if not harness.SANITIZED:
             self.assertLessEqual(cost.anonymous, MEMORY)
         return cost.log
@@ -36,8 +45,8 @@ class Flood(MachineTest):
         return dict(self.machine.rows()[-1][1])
 
     def test_each_point_with_a_category_of_its_own(self):
-        entries = [point("event", "com.vantor.Flood", f"Category {i}", "N", telemetry=False, at=-3600 + i * 0.001)
-                   for i in range(POINTS)]
+        entries = (point("event", "com.vantor.Flood", f"Category {i}", "N", telemetry=False, at=-3600 + i * 0.001)
+                   for i in range(POINTS))
         log = self.run_flood(entries)
         delivered = min(POINTS, MAX_PAIRS)
         statistics = self.statistics()
@@ -53,31 +62,44 @@ class Flood(MachineTest):
 
     def test_a_category_of_its_own_and_a_long_one(self):
         long = "x" * 4000
-        entries = [point("event", "com.vantor.Flood", f"{long}{i}", "N", telemetry=False, at=-3600 + i * 0.001)
-                   for i in range(max(POINTS // 5, 2000))]
+        entries = (point("event", "com.vantor.Flood", f"{long}{i}", "N", telemetry=False, at=-3600 + i * 0.001)
+                   for i in range(max(POINTS // 5, 2000)))
         log = self.run_flood(entries)
         self.assertLess(self.statistics()["EventsNotReported"], MAX_PAIRS, "text is bounded as well")
         self.assertTrue(any("too many pairs of subsystem and category" in line for line in log))
 
     def test_intervals_that_never_end(self):
-        entries = [point("begin", "com.vantor.Flood", "Open", f"N{i % 7}", interval=str(i), telemetry=False,
-                         at=-3600 + i * 0.001, attributes=[("key", "v" * 60 + str(i))]) for i in range(2 * POINTS)]
-        entries.append(point("end", "com.vantor.Flood", "Open", f"N{(2 * POINTS - 1) % 7}", interval=str(2 * POINTS - 1),
-                             telemetry=False, at=-10))
-        log = self.run_flood(entries)
+        entries = (point("begin", "com.vantor.Flood", "Open", f"N{i % 7}", interval=str(i), telemetry=False,
+                         at=-3600 + i * 0.001, attributes=[("key", "v" * 60 + str(i))]) for i in range(2 * POINTS))
+        last = point("end", "com.vantor.Flood", "Open", f"N{(2 * POINTS - 1) % 7}", interval=str(2 * POINTS - 1),
+                     telemetry=False, at=-10)
+        log = self.run_flood(itertools.chain(entries, [last]))
         self.assertEqual(self.statistics()["IntervalsNotReported"], 1, "the youngest is still open")
         if 2 * POINTS > MAX_OPEN_INTERVALS:
             self.assertTrue(any("open intervals were dropped" in line for line in log), log[-5:])
 
     def test_every_value_is_new_and_as_long_as_may_be(self):
-        entries = []
-        for i in range(POINTS // 10):
+        count = POINTS // 10
+
+        def entry(i):
             value = (str(i) + "-" * 4096)[:4096]
-            entries.append(point("event", "com.vantor.Flood", "Long", value, telemetry=False, string1=(value, value),
-                                 string2=(value[::-1], value[::-1]), number1=("n", "9" * 4000),
-                                 attributes=[(str(k), value[2 + k:]) for k in range(8)], at=-3600 + i * 0.001))
-        log = self.run_flood(entries)
-        self.assertEqual(self.statistics()["EventsNotReported"], len(entries), log)
+            return point("event", "com.vantor.Flood", "Long", value, telemetry=False, string1=(value, value),
+                         string2=(value[::-1], value[::-1]), number1=("n", "9" * 4000),
+                         attributes=[(str(k), value[2 + k:]) for k in range(8)], at=-3600 + i * 0.001)
+
+        log = self.run_flood(map(entry, range(count)))
+        self.assertEqual(self.statistics()["EventsNotReported"], count, log)
+
+    def test_odd_text_in_every_field(self):
+        def entry(i):
+            text, other = ODD[i % len(ODD)], ODD[i // len(ODD) % len(ODD)]
+            return point("event", text, other, f"{text}{i}", telemetry=False, string1=(other, f"{i}{text}"),
+                         number1=(text, other), attributes=[(text, other)], exe="/opt/" + text, comm=other,
+                         at=-3600 + i * 0.001)
+
+        for line in self.run_flood(map(entry, range(POINTS))):
+            assert_plain(self, line)
+        self.assertEqual(self.statistics()["LogObjectsProcessed"], POINTS)
 
 
 class Odd(MachineTest):
@@ -96,17 +118,12 @@ class Odd(MachineTest):
         entries.append(Entry([("MESSAGE", "\x1b[2J"), ("TESSEL_KIND", "event")], at=-1))
         return entries
 
-    def assert_plain(self, text):
-        found = TERMINAL.search(text)
-        self.assertIsNone(found, found and repr(text[max(0, found.start() - 40):found.end() + 40]))
-        self.assertEqual(text, text.encode("utf-8", "replace").decode("utf-8"), "well-formed throughout")
-
     def run_odd(self, write, internal):
         self.machine.set_internal(internal)
         write(self.entries())
         result = self.machine.run()
         self.assert_clean(result)
-        self.assert_plain(result.errors)
+        assert_plain(self, result.errors)
         self.assertFalse(any(line.startswith("error: forged") for line in result.errors.splitlines()))
         rows = self.machine.rows()
         self.assertGreater(len(rows), 50)
