@@ -73,6 +73,7 @@ TEST(SharedStringTest, AbsentEqualsNothingAndEqualTextsAgreeOnTheirHash) {
 TEST(SharedStringTest, PoolKeepsOneRecordPerText) {
   StringPool pool;
   std::vector<StringRef> refs;
+  refs.reserve(1000);
   for (int i = 0; i < 1000; ++i) refs.push_back(pool.intern("text" + std::to_string(i % 300)));
   EXPECT_EQ(pool.size(), 300u);
   for (size_t i = 0; i < refs.size(); ++i) {

@@ -26,6 +26,7 @@ TEST(WorkerQueueTest, CountsEverySubmissionOfManyThreads) {
   WorkerQueue queue("test");
   int count = 0;  // written by the queue alone
   std::vector<std::thread> threads;
+  threads.reserve(4);
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&] {
       for (int j = 0; j < 500; ++j) queue.async([&count] { ++count; });

@@ -11,7 +11,9 @@ constexpr char kTransactionName[] = "com.vantor.tessel.tessel_reporter_activity 
 }
 
 void ReporterActivity::handleActivity(const std::shared_ptr<Activity>& changed) {
-  const std::shared_ptr<Activity> activity = changed;  // kept until the transaction is closed
+  // Kept until the transaction is closed.
+  // NOLINTNEXTLINE(performance-unnecessary-copy-initialization)
+  const std::shared_ptr<Activity> activity = changed;
   const auto transaction = runtime_.openTransaction(kTransactionName);
   const int64_t state = activity->state();
   if (state == kActivityStateRun) {
