@@ -12,12 +12,20 @@ namespace tessel {
 
 namespace {
 
-uint64_t processSeed() {
-  static const uint64_t seed = [] {
+// Either factor of a product holds one of them: with a factor that a text alone decides, a text
+// could make the product zero, and with it forget what went before.
+struct Seeds {
+  uint64_t first;
+  uint64_t second;
+};
+
+const Seeds& processSeeds() {
+  static const Seeds seeds = [] {
     std::random_device device;
-    return (uint64_t{device()} << 32) ^ device();
+    const auto word = [&] { return (uint64_t{device()} << 32) ^ device(); };
+    return Seeds{word(), word()};
   }();
-  return seed;
+  return seeds;
 }
 
 __extension__ using Wide = unsigned __int128;
@@ -36,17 +44,17 @@ uint64_t load(const char* at, size_t count) {
 }  // namespace
 
 uint64_t hashText(std::string_view text) {
-  constexpr uint64_t kFirst = 0x9e3779b97f4a7c15u;
-  constexpr uint64_t kSecond = 0xd1b54a32d192ed03u;
-  uint64_t state = processSeed() ^ kFirst;
+  constexpr uint64_t kOdd = 0x9e3779b97f4a7c15u;
+  const auto [first, second] = processSeeds();
+  uint64_t state = first;
   const char* at = text.data();
   size_t left = text.size();
   for (; left > 16; at += 16, left -= 16) {
-    state = mix(load(at, 8) ^ kFirst ^ state, load(at + 8, 8) ^ kSecond);
+    state = mix(load(at, 8) ^ state, load(at + 8, 8) ^ second);
   }
   const size_t low = left < 8 ? left : 8;
-  state = mix(load(at, low) ^ state, load(at + low, left - low) ^ kSecond ^ state);
-  return mix(state ^ text.size(), kFirst);
+  state = mix(load(at, low) ^ state, load(at + low, left - low) ^ second);
+  return mix(state ^ text.size(), kOdd);
 }
 
 SharedString::SharedString(std::string_view text, uint64_t hash) {

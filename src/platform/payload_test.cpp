@@ -70,6 +70,23 @@ TEST(SharedStringTest, AbsentEqualsNothingAndEqualTextsAgreeOnTheirHash) {
   EXPECT_FALSE(sameString(one, SharedString("One")));
 }
 
+// Words that the hash multiplies by, and others that a product may not survive.
+TEST(SharedStringTest, NoWordMakesTheHashForgetWhatStandsBeforeItOrInWhichOrder) {
+  const auto bytes = [](uint64_t word) {
+    return std::string(reinterpret_cast<const char*>(&word), sizeof word);
+  };
+  const uint64_t words[] = {0, ~uint64_t{0}, 0x9e3779b97f4a7c15u, 0xd1b54a32d192ed03u};
+  for (const uint64_t word : words) {
+    for (const std::string& end : {std::string(), std::string("end")}) {
+      const std::string chosen = bytes(word) + end;
+      EXPECT_NE(hashText("Flood--1" + chosen), hashText("Flood--2" + chosen)) << word;
+      EXPECT_NE(hashText(bytes(1) + bytes(2) + end),
+                hashText(bytes(2 ^ word) + bytes(1 ^ word) + end))
+          << word;
+    }
+  }
+}
+
 TEST(SharedStringTest, PoolKeepsOneRecordPerText) {
   StringPool pool;
   std::vector<StringRef> refs;
