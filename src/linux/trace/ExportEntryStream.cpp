@@ -82,8 +82,8 @@ void ExportEntryStream::dropKept() {
   resources_.bytesKept -= keptBeyondUsual(0);
   kept_.clear();
   keptFields_.clear();
-  if (kept_.capacity() > kUsualEntry) kept_ = {};
-  if (keptFields_.capacity() > kUsualEntry / sizeof(KeptField)) keptFields_ = {};
+  if (kept_.capacity() > kUsualEntry) kept_.shrink_to_fit();
+  if (keptFields_.capacity() > kUsualEntry / sizeof(KeptField)) keptFields_.shrink_to_fit();
 }
 
 ExportEntryStream::Outcome ExportEntryStream::readEntry() {
@@ -153,13 +153,22 @@ ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view n
   head.append(window_.bytes().substr(0, shown));
   if (!window_.skip(length) || !window_.fill(1)) return Outcome::ended;
   if (window_.bytes().front() != '\n') {
-    // The length is wrong, so the empty line to go on after may lie within it.
-    window_.rewind(lengthPlace);
+    goBackWithin(lengthPlace);
     return bad("value of another length than stated");
   }
   window_.consume(1);
   const size_t nameLength = head.find('=');
   return takeField(nameLength, head, nameLength + 1 + length);
+}
+
+// Where a length is wrong, the empty line to go on after may lie within it. A file of nothing but
+// wrong lengths must still be read in time of its size.
+void ExportEntryStream::goBackWithin(uint64_t place) {
+  constexpr uint64_t kTimesOver = 8;
+  const uint64_t distance = window_.place() - place;
+  if (wentBack_ + distance > kTimesOver * window_.place()) return;
+  wentBack_ += distance;
+  window_.rewind(place);
 }
 
 ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::string_view head,

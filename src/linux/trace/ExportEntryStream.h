@@ -72,6 +72,7 @@ class ExportEntryStream final : public EntryStream {
   Outcome finishEntry();
   bool readLine(Line& line);
   bool readLongLine(Line& line);
+  void goBackWithin(uint64_t place);
   bool resynchronise();
   void waitAtEntry();
   Outcome bad(std::string_view reason);
@@ -89,6 +90,7 @@ class ExportEntryStream final : public EntryStream {
   bool resynchronising_ = false;
   uint64_t entryPlace_ = 0;
   uint64_t incompletePlace_ = ~uint64_t{0};  // where an incomplete entry was counted
+  uint64_t wentBack_ = 0;                    // bytes, for wrong lengths
   std::string kept_;                         // heads of the wanted fields of the entry
   std::vector<KeptField> keptFields_;
 };

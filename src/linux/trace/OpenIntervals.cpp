@@ -108,7 +108,7 @@ void OpenIntervals::removeAt(size_t slot) {
   (node.older == kNone ? oldest_ : nodes_[node.older].younger) = node.younger;
   (node.younger == kNone ? youngest_ : nodes_[node.younger].older) = node.older;
   attributes_ -= node.interval.attributes.size();
-  node.interval.attributes = {};
+  node.interval.attributes = std::vector<FieldToken>();  // gives its memory back
   free_.push_back(at);
   --size_;
   eraseSlot(slot);
@@ -147,7 +147,7 @@ void OpenIntervals::dropFrom(uint32_t node) {
   (oldest_ == kNone ? youngest_ : nodes_[oldest_].older) = kNone;
   for (uint32_t at = node; at != kNone; at = nodes_[at].older) {
     attributes_ -= nodes_[at].interval.attributes.size();
-    nodes_[at].interval.attributes = {};
+    nodes_[at].interval.attributes = std::vector<FieldToken>();
     free_.push_back(at);
     --size_;
     ++dropped_;

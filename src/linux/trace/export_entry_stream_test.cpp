@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
@@ -185,6 +186,17 @@ TEST_P(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
   EXPECT_THAT(readAll(), ElementsAre("3: T=first"));
 }
 
+TEST_P(ExportEntryStreamTest, manyLongWrongLengthsAreNotAllGoneBackWithin) {
+  std::string text;
+  for (int i = 0; i < 50'000; ++i) text += binary("A", "", 300'007) + "\n";
+  for (int i = 0; i < 20'000; ++i) text += kGood;
+  append(text);
+  EXPECT_GT(readAll().size(), 5'000u);
+  ASSERT_EQ(report.problems.size(), 1u);
+  EXPECT_EQ(report.problems[0].reason, "value of another length than stated");
+  EXPECT_LT(report.problems[0].count, 50u);
+}
+
 TEST_P(ExportEntryStreamTest, badDataThatIsNotOverYetIsCountedOnce) {
   append("garbage\nmore");
   EXPECT_THAT(readAll(), IsEmpty());
@@ -203,32 +215,55 @@ TEST_P(ExportEntryStreamTest, aStopEndsIt) {
   EXPECT_THAT(problems(), IsEmpty());
 }
 
-TEST(ExportResourcesTest, whatAllStreamsKeepIsBounded) {
-  const int file = ::memfd_create("large", 0);
-  std::string text = "__REALTIME_TIMESTAMP=1\n";
-  for (int i = 0; i < 250; ++i) text += "T=" + std::string(4000, 'x') + "\n";
-  text += "\n" + std::string(kGood);
-  ASSERT_EQ(::write(file, text.data(), text.size()), ssize_t(text.size()));
-  const std::string path = "/proc/self/fd/" + std::to_string(file);
-  RecordingTokenizer tokenizer;
-  StopFlag stop = false;
-  FileReport report;
-  WindowBudget windows;
-  ExportReadResources resources{windows};
-  std::vector<std::unique_ptr<ExportEntryStream>> streams;
+// Many streams of one store over a file with an entry of a megabyte and a usual one behind it.
+class ExportResourcesTest : public ::testing::Test {
+ protected:
+  ExportResourcesTest() {
+    std::string text = "__REALTIME_TIMESTAMP=1\n";
+    for (int i = 0; i < 250; ++i) text += "T=" + std::string(4000, 'x') + "\n";
+    text += "\n" + std::string(kGood);
+    EXPECT_EQ(::write(file_, text.data(), text.size()), ssize_t(text.size()));
+  }
+  ~ExportResourcesTest() override { ::close(file_); }
+
+  ExportEntryStream& addStream() {
+    const std::string path = "/proc/self/fd/" + std::to_string(file_);
+    return *streams_.emplace_back(std::make_unique<ExportEntryStream>(
+        ::open(path.c_str(), O_RDONLY), resources_, tokenizer_, stop_, report_));
+  }
+
+  const int file_ = ::memfd_create("large", 0);
+  RecordingTokenizer tokenizer_;
+  StopFlag stop_ = false;
+  FileReport report_;
+  WindowBudget windows_;
+  ExportReadResources resources_{windows_};
+  std::vector<std::unique_ptr<ExportEntryStream>> streams_;
+};
+
+TEST_F(ExportResourcesTest, whatAllStreamsKeepIsBounded) {
   size_t large = 0;
   for (int i = 0; i < 20; ++i) {
-    streams.push_back(std::make_unique<ExportEntryStream>(::open(path.c_str(), O_RDONLY), resources,
-                                                          tokenizer, stop, report));
-    ASSERT_TRUE(streams.back()->next());
-    large += streams.back()->header().realtime == 1;
-    EXPECT_LE(resources.bytesKept, ExportEntryStream::kMaxBytesKeptByAll);
+    ExportEntryStream& stream = addStream();
+    ASSERT_TRUE(stream.next());
+    large += stream.header().realtime == 1;
+    EXPECT_LE(resources_.bytesKept, ExportEntryStream::kMaxBytesKeptByAll);
   }
   EXPECT_EQ(large, 4u);
-  EXPECT_EQ(report.problems.at(0).count, 16u);
-  streams.clear();
-  EXPECT_EQ(resources.bytesKept, 0u);
-  ::close(file);
+  EXPECT_EQ(report_.problems.at(0).count, 16u);
+  streams_.clear();
+  EXPECT_EQ(resources_.bytesKept, 0u);
+}
+
+TEST_F(ExportResourcesTest, theMemoryOfALargeEntryIsGivenBackWithTheNext) {
+  const auto taken = [] { return ::mallinfo2().uordblks + ::mallinfo2().hblkhd; };
+  const size_t before = taken();
+  for (int i = 0; i < 40; ++i) {
+    ExportEntryStream& stream = addStream();
+    ASSERT_TRUE(stream.next() && stream.header().realtime == 1);
+    ASSERT_TRUE(stream.next() && stream.header().realtime == 7);
+  }
+  EXPECT_LT(taken(), before + 40 * WindowBudget::kLargest + (size_t{4} << 20));
 }
 
 TEST(ExportPipeTest, aPipeIsReadToItsEnd) {
