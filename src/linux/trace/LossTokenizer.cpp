@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <iterator>
 
 namespace tessel {
 
@@ -12,12 +13,21 @@ constexpr std::string_view kCount = "N_DROPPED";
 constexpr std::string_view kUnit = "OBJECT_SYSTEMD_UNIT";
 constexpr std::string_view kLossMessage = "a596d6fe7bfa4994828e72309e95d61e";
 
-// The message, then the counts, then the units.
+// The message, then the counts, each by its number, then the units.
 constexpr FieldToken kLossToken = kFirstReservedToken;
 constexpr FieldToken kFirstCount = kFirstReservedToken + 1;
 constexpr FieldToken kFirstUnit = kFirstReservedToken + 0x40000000;
 
 bool isOurs(FieldToken token) { return token >= kFirstReservedToken; }
+
+// A count beyond what a token can say is taken for the greatest that it can.
+FieldToken countToken(std::string_view value) {
+  uint64_t number = 0;
+  const auto [end, error] = std::from_chars(value.data(), value.data() + value.size(), number);
+  if (error != std::errc()) return kNoToken;
+  return kFirstCount +
+         static_cast<FieldToken>(std::min<uint64_t>(number, kFirstUnit - 1 - kFirstCount));
+}
 
 }  // namespace
 
@@ -31,20 +41,19 @@ FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view valu
     met_ = true;
     return kLossToken;
   }
-  if (field == kCount) return valueToken(value, counts_, kFirstCount);
-  if (field == kUnit) return valueToken(value, units_, kFirstUnit);
+  if (field == kCount) return countToken(value);
+  if (field == kUnit) return unitToken(value);
   return user_.tokenFor(field, value, size);
 }
 
-FieldToken LossTokenizer::valueToken(std::string_view value, std::vector<std::string>& values,
-                                     FieldToken first) {
-  const auto known = std::find(values.begin(), values.end(), value);
-  const auto index = static_cast<FieldToken>(known - values.begin());
-  if (known == values.end()) {
-    if (values.size() >= kMaxUnits) return kNoToken;
-    values.emplace_back(value);
-  }
-  return first + index;
+FieldToken LossTokenizer::unitToken(std::string_view name) {
+  if (name.empty() || name.size() > kMaxUnitLength) return kNoToken;
+  if (const auto known = unitTokens_.find(name); known != unitTokens_.end()) return known->second;
+  if (units_.size() > kMaxUnits) return kNoToken;
+  const FieldToken token = kFirstUnit + static_cast<FieldToken>(units_.size());
+  units_.push_back({std::string(name), 0});
+  unitTokens_.emplace(name, token);
+  return token;
 }
 
 std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
@@ -61,25 +70,24 @@ std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> t
 void LossTokenizer::count(std::span<const FieldToken> tokens) {
   bool loss = false;
   uint64_t number = 0;
-  std::string unit;
+  size_t unit = 0;
   for (const FieldToken token : tokens) {
     if (token == kLossToken) {
       loss = true;
     } else if (token >= kFirstUnit) {
-      unit = units_[token - kFirstUnit];
+      unit = token - kFirstUnit;
     } else if (token >= kFirstCount) {
-      const std::string& text = counts_[token - kFirstCount];
-      std::from_chars(text.data(), text.data() + text.size(), number);
+      number = token - kFirstCount;
     }
   }
-  if (loss) unitNamed(unit).count += number;
+  if (loss) units_[unit].count += number;
 }
 
-DroppedEntries& LossTokenizer::unitNamed(const std::string& unit) {
-  const auto known = std::find_if(dropped_.begin(), dropped_.end(),
-                                  [&](const DroppedEntries& one) { return one.unit == unit; });
-  if (known != dropped_.end()) return *known;
-  return dropped_.emplace_back(DroppedEntries{unit, 0});
+std::vector<DroppedEntries> LossTokenizer::dropped() const {
+  std::vector<DroppedEntries> dropped;
+  std::copy_if(units_.begin(), units_.end(), std::back_inserter(dropped),
+               [](const DroppedEntries& one) { return one.count != 0; });
+  return dropped;
 }
 
 }  // namespace tessel

@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include <map>
 #include <span>
 #include <string>
 #include <vector>
@@ -16,8 +17,9 @@ namespace tessel {
 
 class LossTokenizer final : public FieldTokenizer {
  public:
-  // Counts and units that are kept apart; further ones are counted under no unit.
+  // Units that are kept apart, and the longest name of one; what others lost is counted under none.
   static constexpr size_t kMaxUnits = 4096;
+  static constexpr size_t kMaxUnitLength = 256;
 
   // `user` must outlive this.
   explicit LossTokenizer(FieldTokenizer& user) : user_(user) {}
@@ -30,18 +32,17 @@ class LossTokenizer final : public FieldTokenizer {
   // The user's tokens among those of an entry; valid until the next call. Where the entry tells of
   // a loss, that is counted.
   std::span<const FieldToken> takeOwn(std::span<const FieldToken> tokens);
-  const std::vector<DroppedEntries>& dropped() const { return dropped_; }
+  // What was counted, of no unit first, then in order of first sight.
+  std::vector<DroppedEntries> dropped() const;
 
  private:
-  FieldToken valueToken(std::string_view value, std::vector<std::string>& values, FieldToken first);
+  FieldToken unitToken(std::string_view name);
   void count(std::span<const FieldToken> own);
-  DroppedEntries& unitNamed(const std::string& unit);
 
   FieldTokenizer& user_;
   bool met_ = false;  // an entry may tell of a loss
-  std::vector<std::string> counts_;
-  std::vector<std::string> units_;
-  std::vector<DroppedEntries> dropped_;
+  std::map<std::string, FieldToken, std::less<>> unitTokens_;
+  std::vector<DroppedEntries> units_ = std::vector<DroppedEntries>(1);  // first what is of none
   std::vector<FieldToken> theirs_;
 };
 

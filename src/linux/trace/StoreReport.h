@@ -34,7 +34,7 @@ struct FileReport {
 
 // Entries that the journal daemon dropped, by the unit that wrote them.
 struct DroppedEntries {
-  std::string unit;  // empty: the daemon named none
+  std::string unit;  // empty: the daemon named none, or one too many
   uint64_t count = 0;
 };
 
@@ -49,7 +49,7 @@ struct StoreReport {
   // Jumps of the sequence number by more than one, and the numbers left out by them.
   uint64_t sequenceGaps = 0;
   uint64_t missingEntries = 0;
-  std::vector<DroppedEntries> dropped;  // in order of first sight
+  std::vector<DroppedEntries> dropped;  // of no unit first, then in order of first sight
   uint64_t filesNotLookedAt = 0;        // beyond the limit on the number of files
 
   // Whether the store reaches back to the start of the range.

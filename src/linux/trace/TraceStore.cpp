@@ -38,11 +38,11 @@ class SequenceWatch {
   };
 
   void advance(Sequence& sequence, uint64_t number) {
-    if (number > sequence.number + 1) {
-      ++gaps_;
-      missing_ += number - sequence.number - 1;
-    }
-    sequence.number = std::max(sequence.number, number);
+    if (number <= sequence.number) return;
+    const uint64_t leftOut = number - sequence.number - 1;
+    gaps_ += leftOut != 0;
+    missing_ += leftOut;
+    sequence.number = number;
   }
   void change(const EntryHeader& entry);
 

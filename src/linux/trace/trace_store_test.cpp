@@ -15,6 +15,7 @@
 #include "linux/testing/TemporaryDirectory.h"
 #include "linux/trace/ForeignJournalStream.h"
 #include "linux/trace/JournalFormat.h"
+#include "linux/trace/LossTokenizer.h"
 #include "linux/trace/testing/JournalOracle.h"
 #include "linux/trace/testing/JournalWriter.h"
 
@@ -179,6 +180,9 @@ TEST(TraceStoreTest, TellsGapsInTheSequence) {
   const Reading reading = readStore(directory.path());
   EXPECT_EQ(reading.report.sequenceGaps, 1u);
   EXPECT_EQ(reading.report.missingEntries, 3u);
+  const std::string last = "__REALTIME_TIMESTAMP=1\n__SEQNUM_ID=" + std::string(32, 'a') +
+                           "\n__SEQNUM=18446744073709551615\n\n";
+  EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.sequenceGaps, 0u);
 }
 
 TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
@@ -193,11 +197,35 @@ TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
   writer.add(header, {message, "N_DROPPED=1"});
   const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
   ASSERT_EQ(reading.report.dropped.size(), 2u);
-  EXPECT_EQ(reading.report.dropped[0].unit, "a.service");
-  EXPECT_EQ(reading.report.dropped[0].count, 17u);
-  EXPECT_EQ(reading.report.dropped[1].unit, "");
-  EXPECT_EQ(reading.report.dropped[1].count, 1u);
+  EXPECT_EQ(reading.report.dropped[0].unit, "");
+  EXPECT_EQ(reading.report.dropped[0].count, 1u);
+  EXPECT_EQ(reading.report.dropped[1].unit, "a.service");
+  EXPECT_EQ(reading.report.dropped[1].count, 17u);
   EXPECT_EQ(reading.entries.at(2).fields, (std::vector<std::string>{"PRIORITY=4"}));
+}
+
+// Anyone may write such entries, with any values.
+TEST(TraceStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
+  const TemporaryDirectory directory;
+  JournalWriter writer;
+  EntryHeader header;
+  header.realtime = header.monotonic = 1;
+  const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  constexpr uint64_t kLosses = 5000;
+  static_assert(kLosses > LossTokenizer::kMaxUnits);
+  for (uint64_t i = 1; i <= kLosses; ++i) {
+    const std::string number = std::to_string(i);
+    writer.add(header, {message, "N_DROPPED=" + number, "OBJECT_SYSTEMD_UNIT=u" + number});
+  }
+  const std::string tooLong(LossTokenizer::kMaxUnitLength + 1, 'u');
+  writer.add(header, {message, "N_DROPPED=1", "OBJECT_SYSTEMD_UNIT=" + tooLong});
+  writer.add(header, {message, "N_DROPPED=some"});
+  const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
+  uint64_t sum = 0;
+  for (const DroppedEntries& dropped : reading.report.dropped) sum += dropped.count;
+  EXPECT_EQ(sum, kLosses * (kLosses + 1) / 2 + 1);
+  EXPECT_EQ(reading.report.dropped.size(), LossTokenizer::kMaxUnits + 1);
+  EXPECT_EQ(reading.report.dropped[0].unit, "");
 }
 
 TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
