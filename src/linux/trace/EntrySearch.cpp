@@ -17,9 +17,10 @@ bool EntrySearch::mayHoldObject(uint64_t offset) const {
 
 std::optional<ObjectHeader> EntrySearch::objectAt(uint64_t offset) {
   if (!mayHoldObject(offset)) return std::nullopt;
+  const uint64_t room = searchEnd() - offset;  // reading may find the file cut off before it
   const uint8_t* at = file_.file().at(offset, kObjectHeaderSize);
   if (at == nullptr) return std::nullopt;
-  return file_.objectHeader({at, kObjectHeaderSize}, searchEnd() - offset);
+  return file_.objectHeader({at, kObjectHeaderSize}, room);
 }
 
 // The same without moving the window, for a place that a damaged size may have made up.

@@ -111,20 +111,19 @@ std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> b
 
 uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
   if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
+  const uint64_t room = objectsEnd() - offset;  // reading may find the file cut off before it
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
   // An entry has no flags.
   if (at == nullptr || load<uint64_t>(at) != kEntry) return 0;
   const auto size = load<uint64_t>(at + kObjectSizeAt);
-  if (size <= kEntryItemsAt || size > objectsEnd() - offset ||
-      (size - kEntryItemsAt) % itemSize() != 0)
-    return 0;
+  if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
   entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
   entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
   entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
   entry.bootId = loadId(at + kEntryBootAt);
   entry.contentHash = load<uint64_t>(at + kEntryHashAt);
-  if (entry.sequenceNumber == 0 || entry.realtime == 0 || entry.realtime >= kMaxTime ||
-      entry.monotonic >= kMaxTime)
+  if (entry.sequenceNumber == 0 || entry.sequenceNumber > kMaxSequenceNumber ||
+      entry.realtime == 0 || entry.realtime >= kMaxTime || entry.monotonic >= kMaxTime)
     return 0;
   return size;
 }
@@ -132,12 +131,12 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
 bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch,
                            DataObject& data) {
   if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return false;
-  const uint64_t wanted = dataHeaderSize_ + kMaxFieldHead;
+  const uint64_t room = objectsEnd() - offset;
+  const uint64_t wanted = std::min(room, dataHeaderSize_ + kMaxFieldHead);
   std::span<const uint8_t> bytes = file_.restOfWindow(offset);
   if (bytes.size() < wanted && (bytes.size() < kObjectHeaderSize ||
                                 bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
-    const uint64_t room = std::min(wanted, objectsEnd() - offset);
-    bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(room)})};
+    bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(wanted)})};
   }
   if (bytes.size() <= dataHeaderSize_) return false;
   const auto first = load<uint64_t>(bytes.data());
@@ -145,13 +144,12 @@ bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scr
   // Type and flags, then six reserved bytes.
   if ((first & ~(uint64_t{kKnownDataFlags} << 8)) != kData) return false;
   const auto size = load<uint64_t>(bytes.data() + kObjectSizeAt);
-  if (size <= dataHeaderSize_ || size > objectsEnd() - offset) return false;
+  const uint64_t shown = std::min(size, wanted);
+  if (size <= dataHeaderSize_ || size > room || shown > bytes.size()) return false;
   data.entryCount = load<uint64_t>(bytes.data() + kDataEntryCountAt);
   data.payloadOffset = offset + dataHeaderSize_;
   data.payloadSize = size - dataHeaderSize_;
-  data.head =
-      bytes.first(static_cast<size_t>(std::min(size, std::min<uint64_t>(wanted, bytes.size()))))
-          .subspan(dataHeaderSize_);
+  data.head = bytes.first(static_cast<size_t>(shown)).subspan(dataHeaderSize_);
   return true;
 }
 

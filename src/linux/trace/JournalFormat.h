@@ -84,6 +84,9 @@ inline constexpr size_t kArrayItemsAt = 24;
 
 // Times beyond this many microseconds, some 1,100 years, are taken for damage.
 inline constexpr uint64_t kMaxTime = uint64_t{1} << 55;
+// So are sequence numbers beyond this one: the files that are merged with the one that holds such a
+// number would all come before the rest of it.
+inline constexpr uint64_t kMaxSequenceNumber = uint64_t{1} << 48;
 
 template <typename T>
 T load(const uint8_t* at) {
