@@ -144,8 +144,8 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   return static_cast<size_t>(kept - tokens);
 }
 
-// Looks at a data object. What only this entry refers to is not remembered, nor is what is none: it
-// may lie across one that is.
+// Looks at a data object. What only this entry refers to is not remembered, unless looking again
+// would be dear, nor is what is none: it may lie across one that is.
 FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
   DataObject data;
   if (!file_.readData(offset, context_.resources.data, data)) {
@@ -158,7 +158,7 @@ FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
     context_.report.addProblem("data object damaged", offset);
     token = kNoToken;
   }
-  if (offset < firstFresh_ || data.entryCount != 1)
+  if (offset < firstFresh_ || data.entryCount != 1 || data.compression != 0)
     TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, token);
   return token;
 }

@@ -89,6 +89,7 @@ struct TraceStore::State final : EntryStream {
   void openFiles(StoreFiles found);
   void openFile(StoreFile& file, uint32_t number);
   void openJournal(StoreFile& file, uint32_t number);
+  void openForeign(StoreFile& file, uint64_t entryCount, uint32_t number);
   bool outsideRange(const JournalHeader& header) const;
   std::optional<PlatformError> failure(const std::string& place) const;
   void seeTime(uint64_t realtime) {
@@ -102,6 +103,7 @@ struct TraceStore::State final : EntryStream {
   LossTokenizer tokenizer;
   StoreReport facts;  // its files are complete before the first stream is made
   size_t usableFiles = 0;
+  size_t foreignFiles = 0;  // that journalctl reads for us
   SequenceWatch sequences;
   StoreMerger merger;
 };
@@ -158,14 +160,7 @@ void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
-    auto foreign = ForeignJournalStream::start(file.path, plausibleEntries(header, size), exports,
-                                               tokenizer, stop, report);
-    if (!foreign) {
-      report.skipped = "written with features that are not known";
-      return;
-    }
-    ++usableFiles;
-    merger.add(std::move(foreign), number, kNoSequence);
+    openForeign(file, plausibleEntries(header, size), number);
     return;
   }
   ++usableFiles;
@@ -179,6 +174,25 @@ void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
                  std::move(file.fd), size, header, number,
                  JournalEntryStream::Context{resources, tokenizer, stop, report}),
              number, header.sequenceId);
+}
+
+// Each such file takes a process, so not all of a great many are read.
+void TraceStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
+  FileReport& report = facts.files[number];
+  if (foreignFiles == kMaxForeignFiles) {
+    report.skipped = "written with features that are not known, as are " +
+                     std::to_string(kMaxForeignFiles) + " files before it";
+    return;
+  }
+  auto stream =
+      ForeignJournalStream::start(file.path, entryCount, exports, tokenizer, stop, report);
+  if (!stream) {
+    report.skipped = "written with features that are not known";
+    return;
+  }
+  ++foreignFiles;
+  ++usableFiles;
+  merger.add(std::move(stream), number, kNoSequence);
 }
 
 // A clock that was set back within the file shows where its ends stand the wrong way round.

@@ -29,6 +29,8 @@ class TraceStore {
  public:
   // Files of a store that are looked at; the others are counted in the report.
   static constexpr size_t kMaxFiles = 8192;
+  // Files of a layout that is not known; each is read by a journalctl of its own.
+  static constexpr size_t kMaxForeignFiles = 16;
 
   // Opens the store at `path`, the machine's own journal where it is absent. An error names the
   // path and the reason: there is no such place, it may not be read, it holds nothing that is a

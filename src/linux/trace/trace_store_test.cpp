@@ -269,6 +269,18 @@ TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
       << "no more than the file can hold";
 }
 
+TEST(TraceStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
+  const TemporaryDirectory directory;
+  std::string file = someJournal(1);
+  file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
+  for (size_t i = 0; i <= TraceStore::kMaxForeignFiles; ++i)
+    directory.write(std::to_string(100 + i) + ".journal", file);
+  const Reading reading = readStore(directory.path());
+  for (size_t i = 0; i < TraceStore::kMaxForeignFiles; ++i)
+    EXPECT_EQ(reading.report.files.at(i).skipped, std::nullopt) << i;
+  EXPECT_THAT(reading.report.files.back().skipped.value_or(""), HasSubstr("16 files before it"));
+}
+
 TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
   const TemporaryDirectory directory;
   const std::string path = directory.write("a.journal", someJournal(100));
