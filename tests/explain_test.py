@@ -334,6 +334,19 @@ class Reading(ExplainTest):
         self.assertEqual([(os.path.basename(file["path"]), file["entries_read"]) for file in summary["files"]],
                          [("a.export", 6)])
 
+    def test_what_the_store_lacks_is_told(self):
+        self.machine.write_export([log_event("plain", at=-90), point("event", "a", "b", exe=None)])
+        self.machine.write_export([Entry([("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
+                                          ("OBJECT_SYSTEMD_UNIT", "vantor.service")], at=-30)], "b.export",
+                                  first_sequence=10)
+        store = self.summary()["store"]
+        self.assertEqual((store["sequence_gaps"], store["missing"], store["reaches_start"]), (1, 7, False))
+        self.assertEqual(store["dropped"], [{"unit": "vantor.service", "count": 7}])
+        self.assertEqual(self.summary()["without_exe"], 1)
+        text = self.machine.ctl("explain", "--summary").out
+        for words in ("reaches back to", "by 1 gap", "of vantor.service", "_EXE of trace points"):
+            self.assertIn(words, text)
+
     def test_a_damaged_file_is_named_and_the_rest_is_read(self):
         self.machine.write_export([point("event", "com.vantor.A", "B", "C")])
         with open(os.path.join(self.machine.store, "b.export"), "wb") as file:

@@ -133,7 +133,7 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   FieldToken* kept = tokens;
   for (size_t i = 0; i < count; ++i) {
     const uint64_t offset = load<Item>(items + i * step);
-    FieldToken token = cache.find(offset);
+    FieldToken token = offset <= TokenCache::kMaxOffset ? cache.find(offset) : TokenCache::kUnknown;
     if (token == TokenCache::kUnknown) [[unlikely]] {
       if (context_.stop.load(std::memory_order_relaxed)) break;
       token = newTokenAt(offset);

@@ -69,7 +69,7 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   const bool growing = header.beingWritten() && aligned(lastObject) &&
                        lastObject >= header.headerSize && lastObject < header.objectsEnd;
   header.lastObject = growing ? lastObject : UINT64_MAX;
-  header.entryCount = load<uint64_t>(at + kEntryCountAt);
+  header.entryCount = std::min(load<uint64_t>(at + kEntryCountAt), fileSize / kEntryItemsAt);
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
   header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);

@@ -27,7 +27,7 @@ struct JournalHeader {
   Id128 sequenceId{};
   uint64_t headerSize = 0;  // where the objects begin
   uint64_t objectsEnd = 0;  // where they end, at most the size of the file
-  uint64_t entryCount = 0;  // entries linked, by the header's word
+  uint64_t entryCount = 0;  // entries linked, by the header's word, at most what the file can hold
   uint64_t entryArray = 0;  // offset of the first entry array; 0: none
   uint64_t lastObject = 0;  // offset of the last object that counts; UINT64_MAX: all that are there
   uint64_t headRealtime = 0;  // of the first and last entry written; 0: unknown

@@ -30,6 +30,8 @@ class TokenCache {
   using Line = std::array<FieldToken, kWords>;
 
  public:
+  // No file is as large as that; greater offsets would be taken for those of other files.
+  static constexpr uint64_t kMaxOffset = (uint64_t{1} << (kFileShift + kRegionShift)) - 1;
   // Answered where nothing is remembered. No token has this value.
   static constexpr FieldToken kUnknown = UINT32_MAX;
 
@@ -54,7 +56,8 @@ class TokenCache {
           lines_(cache.lines_.get()),
           file_(uint64_t{file + 1} << kFileShift) {}
 
-    // The token of the data object at `offset`; kUnknown where it is not remembered.
+    // The token of the data object at `offset`, at most kMaxOffset; kUnknown where it is not
+    // remembered.
     FieldToken find(uint64_t offset) const {
       const uint64_t region = regionOf(offset);
       const size_t line = lineOf(region);

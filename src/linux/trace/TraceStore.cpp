@@ -69,11 +69,6 @@ void SequenceWatch::change(const EntryHeader& entry) {
 // Of a stream whose entries may count in any sequence.
 constexpr Id128 kNoSequence{};
 
-// What the header says of a file whose layout is not known, as far as the file can hold it.
-uint64_t plausibleEntries(const JournalHeader& header, uint64_t size) {
-  return std::min(header.entryCount, size / journal_format::kEntryItemsAt);
-}
-
 }  // namespace
 
 struct TraceStore::State final : EntryStream {
@@ -160,7 +155,7 @@ void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
   if (header.unknownFlags() != 0) {
-    openForeign(file, plausibleEntries(header, size), number);
+    openForeign(file, header.entryCount, number);
     return;
   }
   ++usableFiles;

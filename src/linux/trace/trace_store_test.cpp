@@ -269,6 +269,29 @@ TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
       << "no more than the file can hold";
 }
 
+// It would else be decompressed for each of the entry's items.
+TEST(TraceStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
+  const TemporaryDirectory directory;
+  JournalLayout layout;
+  layout.compression = journal_format::kZstd;
+  JournalWriter writer(layout);
+  writer.add({.realtime = 1},
+             std::vector<std::string>(1000, "TESSEL_NAME=" + std::string(4000, 'x')));
+  std::string file = writer.bytes();
+  const uint64_t thousand = 1000;
+  const uint64_t one = 1;
+  const size_t count =
+      file.find(std::string(reinterpret_cast<const char*>(&thousand), 8), layout.headerSize);
+  ASSERT_NE(count, std::string::npos);
+  file.replace(count, 8, reinterpret_cast<const char*>(&one), 8);
+  const std::string path = directory.write("a.journal", file);
+  testing::RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  ASSERT_EQ(testing::readAll(std::get<0>(opened)->entries(), tokenizer).at(0).fields.size(), 1000u);
+  EXPECT_EQ(tokenizer.shown(), 1u);
+}
+
 TEST(TraceStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
   const TemporaryDirectory directory;
   std::string file = someJournal(1);

@@ -57,6 +57,22 @@ void writeFile(std::string& out, const FileReport& file) {
   object.array("problems", file.problems, writeProblem).end();
 }
 
+void writeDropped(std::string& out, const DroppedEntries& dropped) {
+  JsonObject(out).text("unit", std::string_view(dropped.unit)).count("count", dropped.count).end();
+}
+
+// What is known of the store beside its files.
+void writeStore(std::string& out, const StoreReport& store) {
+  JsonObject object(out);
+  if (store.oldestEntry) object.count("oldest", *store.oldestEntry);
+  object.boolean("reaches_start", store.reachesRangeStart())
+      .count("duplicates", store.duplicateEntries)
+      .count("sequence_gaps", store.sequenceGaps)
+      .count("missing", store.missingEntries)
+      .count("files_not_looked_at", store.filesNotLookedAt);
+  object.array("dropped", store.dropped, writeDropped).end();
+}
+
 void writeKinds(std::string& out, const Tally& tally) {
   JsonObject object(out);
   for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
@@ -194,6 +210,35 @@ std::string lossLines(const ExtractionReport& report, const Terminal& terminal) 
   return table.empty() ? "" : "\n" + table.render(terminal, 2);
 }
 
+// What the store itself has lost or never had; empty where nothing is missing.
+std::string storeLines(const ExtractionReport& report, const Terminal& terminal) {
+  const StoreReport& store = report.store;
+  std::string out;
+  if (store.oldestEntry && !store.reachesRangeStart()) {
+    const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*store.oldestEntry)}};
+    out = "\nThe store reaches back to " + dateText(oldest) + " only.\n";
+  }
+  Table table(
+      {{"NUMBER", Table::Align::right}, {"WHAT THE STORE LACKS", Table::Align::left, true}});
+  if (store.missingEntries != 0) {
+    table.add(
+        {grouped(store.missingEntries),
+         "entries, by " + counted(store.sequenceGaps, "gap", "gaps") + " in the sequence numbers"});
+  }
+  for (const DroppedEntries& dropped : store.dropped) {
+    table.add({grouped(dropped.count),
+               "entries that the journal daemon dropped, of " +
+                   (dropped.unit.empty() ? "no unit" : terminalText(dropped.unit))});
+  }
+  if (report.assembly.withoutImagePath != 0) {
+    table.add({grouped(report.assembly.withoutImagePath),
+               "_EXE of trace points, whose process was gone too soon"});
+  }
+  if (store.filesNotLookedAt != 0)
+    table.add({grouped(store.filesNotLookedAt), "files that were too many to look at"});
+  return out + (table.empty() ? "" : "\n" + table.render(terminal, 2));
+}
+
 std::string fileLines(const StoreReport& store, const Terminal& terminal) {
   Table table({{"PROBLEM", Table::Align::left, true},
                {"TIMES", Table::Align::right},
@@ -240,6 +285,8 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
   object.count("whitelist_misses_not_listed", tally.missesNotListed());
   object.nested("intervals", [&](std::string& inner) { writeIntervals(inner, report.assembly); });
   object.count("beyond_pair_limit", report.beyondPairLimit);
+  object.count("without_exe", report.assembly.withoutImagePath);
+  object.nested("store", [&](std::string& inner) { writeStore(inner, report.store); });
   object.array("files", report.store.files, writeFile);
   object.number("start", Number{int64_t{tally.period().start.time_since_epoch().count()}});
   object.number("end", Number{int64_t{tally.period().end.time_since_epoch().count()}});
@@ -259,7 +306,8 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
     out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +
            missTable(tally, terminal);
   }
-  return out + lossLines(report, terminal) + fileLines(report.store, terminal);
+  return out + lossLines(report, terminal) + storeLines(report, terminal) +
+         fileLines(report.store, terminal);
 }
 
 }  // namespace tessel::ctl
