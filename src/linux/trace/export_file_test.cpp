@@ -59,6 +59,7 @@ TEST_F(ExportFileTest, writersDoNotMixTheirEntries) {
   constexpr int kWriters = 4;
   constexpr int kEach = 50;
   std::vector<std::thread> writers;
+  writers.reserve(kWriters);
   for (int writer = 0; writer < kWriters; ++writer) {
     writers.emplace_back([this, writer] {
       for (int i = 0; i < kEach; ++i)

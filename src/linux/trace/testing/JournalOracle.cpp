@@ -71,6 +71,7 @@ PlainEntry currentEntry(sd_journal* journal) {
 
 std::vector<PlainEntry> readWithLibsystemd(const std::vector<std::string>& files) {
   std::vector<const char*> paths;
+  paths.reserve(files.size() + 1);
   for (const std::string& file : files) paths.push_back(file.c_str());
   paths.push_back(nullptr);
   sd_journal* journal = nullptr;
