@@ -1,7 +1,6 @@
 #include "linux/trace/ByteWindow.h"
 
 #include <poll.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>

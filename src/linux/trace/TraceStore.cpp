@@ -190,7 +190,8 @@ void TraceStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32
   merger.add(std::move(stream), number, kNoSequence);
 }
 
-// A clock that was set back within the file shows where its ends stand the wrong way round.
+// A clock that was set back within the file shows where its ends stand the wrong way round; one
+// that was also set forward again does not, and the file counts as what its ends say.
 bool TraceStore::State::outsideRange(const JournalHeader& header) const {
   if (header.beingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
