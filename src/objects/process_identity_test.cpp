@@ -21,38 +21,30 @@ class ProcessIdentityTest : public ::testing::Test {
 };
 
 TEST_F(ProcessIdentityTest, TheNearestDirectoryNamedAfterTheImageDecides) {
-  bundles.identifiers = {{"/apps/ID/Foo.app", "near"},
-                         {"/x/Foo.app", "far"},
-                         {"/y/Foo.app", "behind"},
-                         {"Foo.app", "relative"},
-                         {"/z/Foo.framework", "framework"},
-                         {"/p/Foo", "plain"},
-                         {"/p/foo.app", "case"},
-                         {"/p/Foobar.app", "longer"},
-                         {"/t/Foo.app", "trailing"},
-                         {"/r/Foo.", "dot"}};
   const struct {
     const char* path;
-    const char* identifier;
-  } cases[] = {{"/apps/ID/Foo.app/Foo", "near"},
-               {"/x/Foo.app/a/b/Foo", "far"},
+    const char* bundle;
+    bool found;
+  } cases[] = {{"/apps/ID/Foo.app/Foo", "/apps/ID/Foo.app", true},
+               {"/x/Foo.app/a/b/Foo", "/x/Foo.app", true},
                // The first match decides, even where it is no bundle.
-               {"/y/Foo.app/Foo.noBundle/Foo", "none"},
-               {"/z/Foo.framework/Foo", "framework"},
-               {"Foo.app/Foo", "relative"},
-               {"/p/Foo/Foo", "none"},
-               {"/p/foo.app/Foo", "none"},
-               {"/p/Foobar.app/Foo", "none"},
-               {"/r/Foo./Foo", "dot"},
-               {"/t/Foo.app//Foo/", "trailing"},
-               {"/opt/lib/tool", "none"},
-               {"/Foo", "none"},
-               {"//Foo", "none"},
-               {"/", "none"},
-               {"Foo", "none"},
-               {"Foo/", "none"},
-               {"", "none"}};
-  for (const auto& row : cases) EXPECT_EQ(lookUp(row.path), row.identifier) << row.path;
+               {"/x/Foo.app/Foo.noBundle/Foo", "/x/Foo.app", false},
+               {"/x/Foo.framework/Foo", "/x/Foo.framework", true},
+               {"Foo.app/Foo", "Foo.app", true},
+               {"/x/Foo/Foo", "/x/Foo", false},
+               {"/x/foo.app/Foo", "/x/foo.app", false},
+               {"/x/Foobar.app/Foo", "/x/Foobar.app", false},
+               {"/x/Foo./Foo", "/x/Foo.", true},
+               {"/x/Foo.app//Foo/", "/x/Foo.app", true},
+               {"/x/Foo", "/x", false},
+               {"//Foo", "/", false},
+               {"/", "/", false},
+               {"Foo/", "", false},
+               {"", "", false}};
+  for (const auto& row : cases) {
+    bundles.identifiers = {{row.bundle, "id"}};
+    EXPECT_EQ(lookUp(row.path), row.found ? "id" : "none") << row.path;
+  }
 }
 
 TEST_F(ProcessIdentityTest, NothingIsOpenedButTheDirectoryThatIsNamedAfterTheImage) {

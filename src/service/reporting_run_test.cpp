@@ -86,19 +86,24 @@ TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
                                       "reading the trace store", "summarising", "idle"}));
 }
 
-TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsBeforeTheSummary) {
+TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsAndOneWithoutANameAsOneBeforeTheSummary) {
   TestPoint point;
-  extractor->objects = {makeEvent(point), makeInterval(point), makeAnimationInterval(point)};
+  TestPoint nameless;
+  nameless.name.reset();
+  extractor->objects = {makeEvent(point), makeInterval(point), makeAnimationInterval(point),
+                        makeEvent(nameless)};
   extractor->duringProcessing = [this] { EXPECT_EQ(status.steps, extractor->objects.size()); };
   perform();
   const std::vector<std::string> names = sender.names();
-  ASSERT_GE(names.size(), 7u);
+  ASSERT_GE(names.size(), 8u);
   for (size_t i = 0; i < 6; i += 2) {
     EXPECT_EQ(names[i], "com.vantor.performance.tessel");
     EXPECT_EQ(names[i + 1], "ts__com.vantor.Calendar__View__Open");
     EXPECT_EQ(sender.events[i].json, sender.events[i + 1].json);
   }
-  EXPECT_EQ(names[6], "com.vantor.performance.tessel_counts");
+  EXPECT_EQ(names[6], "com.vantor.performance.tessel");
+  EXPECT_EQ(names[7], "com.vantor.performance.tessel_counts");
+  EXPECT_EQ(reports.at(0).unnamed, 1u);
   EXPECT_EQ(names.back(), "com.vantor.performance.tessel_reporting_stats");
   EXPECT_EQ(
       sender.events[0].json,
@@ -139,18 +144,14 @@ TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
 }
 
 TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
-  const struct {
-    RemovalResult removal;
-    const char* line;
-  } cases[] = {{{false, "Permission denied"}, "Could not clear cookie file: Permission denied"},
-               {{false, {}}, "Could not clear cookie file: Unknown error"}};
-  for (const auto& c : cases) {
-    log.clear();
-    files.items.clear();
-    files.removal = c.removal;
-    perform();
-    EXPECT_EQ(log.errors(), std::vector<std::string>{c.line});
-  }
+  files.removal = RemovalResult{false, "Permission denied"};
+  perform();
+  files.items.clear();
+  files.removal = RemovalResult{false, {}};
+  perform();
+  EXPECT_EQ(log.errors(),
+            (std::vector<std::string>{"Could not clear cookie file: Permission denied",
+                                      "Could not clear cookie file: Unknown error"}));
 }
 
 TEST_F(ReportingRunTest, AMarkerThatIsGoneIsNotClearedAndOneThatIsThereIsNotMade) {
@@ -184,14 +185,26 @@ TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
   EXPECT_EQ(log.count("Could not determine filesystem type"), 2u);
 }
 
-TEST_F(ReportingRunTest, AnObjectWithoutANameSendsTheFixedEventAlone) {
-  TestPoint point;
-  point.name.reset();
-  extractor->objects = {makeEvent(point)};
-  perform();
-  EXPECT_EQ(sender.names().at(0), "com.vantor.performance.tessel");
-  EXPECT_EQ(sender.names().at(1), "com.vantor.performance.tessel_counts");
-  EXPECT_EQ(reports.back().unnamed, 1u);
+// Of a class that says it has a payload and has none.
+struct WithoutPayload final : TesselObject {
+  using TesselObject::TesselObject;
+  bool canGenerateStatoraPayload() const override { return true; }
+  std::optional<Payload> statoraPayload(ProcessIdentity& /*identity*/) const override { return {}; }
+};
+
+TEST_F(ReportingRunTest, AnObjectWhosePayloadCannotBeMadeIsSaidCountedAndNeitherPacedNorSent) {
+  const auto filter = TesselReporterObjectFilter::init(variant);
+  ObjectReporter reporter(road, filter, {}, SharedString("SSD"));
+  const SharedString text("Text");
+  TracePointFields fields;
+  fields.subsystem = fields.category = fields.name = text;
+  fields.telemetryEnabled = true;
+  const auto object = std::make_shared<const WithoutPayload>(fields);
+  for (int i = 0; i < 10; ++i) EXPECT_TRUE(reporter.reportTesselObject(object));
+  EXPECT_EQ(log.count("Failed to create payload for Text/TextText"), 10u);
+  EXPECT_EQ(filter->telemetryReportedAggregation().totalCount(), 10u);
+  EXPECT_EQ(throttle.throttledCount(), 0u);
+  EXPECT_EQ(reportingQueue.pending(), 0u);
 }
 
 TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
@@ -236,54 +249,45 @@ TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferral not requested, continuing."});
 }
 
-TEST_F(ReportingRunTest, FivePairsOfASectionAreSentAndTheRestOnlyCounted) {
+TEST_F(ReportingRunTest, FivePairsOfEachSectionAreSentAndTheRestOnlyCounted) {
   for (int pair = 0; pair < 7; ++pair) {
     TestPoint point;
     point.category = "C" + std::to_string(pair);
-    point.telemetryEnabled = false;
-    for (int i = 0; i <= pair; ++i) extractor->objects.push_back(makeInterval(point));
-  }
-  perform();
-  std::vector<std::string> counts;
-  for (const auto& event : sender.events) {
-    if (event.name == "com.vantor.performance.tessel_counts") counts.push_back(event.json);
-  }
-  ASSERT_EQ(counts.size(), 5u);
-  EXPECT_EQ(status.steps, extractor->objects.size() + 7) << "each object and each pair is progress";
-  EXPECT_EQ(reports.at(0).countEvents, 5u);
-  EXPECT_EQ(
-      counts[0],
-      R"({"Subsystem":"com.vantor.Calendar","Category":"C6","Count":7,"Classification":"AllInspected"})");
-  EXPECT_EQ(
-      counts[4],
-      R"({"Subsystem":"com.vantor.Calendar","Category":"C2","Count":3,"Classification":"AllInspected"})");
-  EXPECT_EQ(log.count("com.vantor.Calendar/C2:\t3 (Count reported to Statora)"), 1u);
-  EXPECT_EQ(log.count("com.vantor.Calendar/C1:\t2 (Count not reported)"), 1u);
-  EXPECT_EQ(log.count("**************\nTotal tessel object count: 28"), 1u);
-  EXPECT_EQ(log.count("**************\nReported tessel object count: 0"), 1u);
-}
-
-TEST_F(ReportingRunTest, EachSectionStartsItsFiveAnew) {
-  variant.internal = true;
-  for (int pair = 0; pair < 6; ++pair) {
-    TestPoint point;
-    point.category = "C" + std::to_string(pair);
-    extractor->objects.push_back(makeEvent(point));
+    for (int i = 0; i <= pair; ++i) extractor->objects.push_back(makeEvent(point));
     point.durationSeconds = -1;
     extractor->objects.push_back(makeEvent(point));
   }
   perform();
-  std::map<std::string, int> perSection;
+  std::map<std::string, std::vector<std::string>> sections;
   for (const auto& event : sender.events) {
-    const auto at = event.json.find("\"Classification\":");
-    if (at != std::string::npos) ++perSection[event.json.substr(at)];
+    const auto at = event.json.find(",\"Count\":");
+    if (event.name != "com.vantor.performance.tessel_counts") continue;
+    const auto comma = event.json.find(',', at + 1);
+    sections[event.json.substr(comma)].push_back(event.json.substr(0, comma));
   }
-  EXPECT_EQ(perSection,
-            (std::map<std::string, int>{{"\"Classification\":\"AllInspected\"}", 5},
-                                        {"\"Classification\":\"Reported\"}", 5},
-                                        {"\"Classification\":\"ReportedEvents\"}", 5},
-                                        {"\"Classification\":\"DurationThresholdFiltered\"}", 5}}));
-  EXPECT_EQ(throttle.throttledCount(), 3u) << "each pair of a section is paced, sent or not";
+  const auto pairs = [](std::vector<std::pair<const char*, int>> expected) {
+    std::vector<std::string> texts;
+    for (const auto& [category, count] : expected) {
+      texts.push_back(std::string(R"({"Subsystem":"com.vantor.Calendar","Category":")") + category +
+                      "\",\"Count\":" + std::to_string(count));
+    }
+    return texts;
+  };
+  const auto reported = pairs({{"C6", 7}, {"C5", 6}, {"C4", 5}, {"C3", 4}, {"C2", 3}});
+  const decltype(sections) expected = {
+      {R"(,"Classification":"AllInspected"})",
+       pairs({{"C6", 8}, {"C5", 7}, {"C4", 6}, {"C3", 5}, {"C2", 4}})},
+      {R"(,"Classification":"Reported"})", reported},
+      {R"(,"Classification":"ReportedEvents"})", reported},
+      {R"(,"Classification":"DurationThresholdFiltered"})",
+       pairs({{"C0", 1}, {"C1", 1}, {"C2", 1}, {"C3", 1}, {"C4", 1}})}};
+  EXPECT_EQ(sections, expected);
+  EXPECT_EQ(reports.at(0).countEvents, 20u);
+  EXPECT_EQ(status.steps, 35u + 28u) << "each object and each pair is progress";
+  EXPECT_EQ(throttle.throttledCount(), 8u) << "each pair of a section is paced, sent or not";
+  EXPECT_EQ(log.count("com.vantor.Calendar/C2:\t4 (Count reported to Statora)"), 1u);
+  EXPECT_EQ(log.count("com.vantor.Calendar/C1:\t3 (Count not reported)"), 1u);
+  EXPECT_EQ(log.count("**************\nTotal tessel object count: 35"), 1u);
 }
 
 TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
@@ -350,21 +354,14 @@ class ReporterActivityTest : public ReportingRunTest {
 };
 
 TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransactionCloses) {
-  const struct {
-    int64_t state;
-    const char* line;
-  } cases[] = {{0, "Checking in\n"},
-               {1, "Unknown state 1\n"},
-               {3, "Unknown state 3\n"},
-               {-5, "Unknown state -5\n"}};
-  for (const auto& c : cases) {
-    log.clear();
+  for (const int64_t state : {0, 1, 3, -5}) {
     runtime.calls.clear();
-    activity->currentState = c.state;
+    activity->currentState = state;
     handle();
-    EXPECT_EQ(log.lines(), std::vector<std::string>{c.line});
     EXPECT_EQ(runtime.calls, aroundEverything);
   }
+  EXPECT_EQ(log.lines(), (std::vector<std::string>{"Checking in\n", "Unknown state 1\n",
+                                                   "Unknown state 3\n", "Unknown state -5\n"}));
   EXPECT_TRUE(reports.empty());
 }
 

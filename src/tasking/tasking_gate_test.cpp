@@ -18,6 +18,10 @@ std::shared_ptr<const ConfigurationValue> taskedOn(ConfigurationValue value) {
   return configuration({Dictionary{{"Other", {Number{false}}}, {"TaskedOn", std::move(value)}}});
 }
 
+std::string notReporting(const std::string& reason) {
+  return "Not reporting based on not being tasked-on by Statora (" + reason + ")";
+}
+
 class TaskingGateTest : public ::testing::Test {
  protected:
   // Delivers the configurations while the gate waits.
@@ -50,10 +54,7 @@ TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
 
 TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSeconds) {
   EXPECT_FALSE(gate.shouldReport());
-  EXPECT_EQ(
-      log.lines(),
-      std::vector<std::string>{
-          "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"});
+  EXPECT_EQ(log.lines(), std::vector{notReporting("Timeout waiting for config")});
   EXPECT_EQ(clock.waits, std::vector<std::chrono::nanoseconds>{std::chrono::seconds{5}});
   EXPECT_EQ(configurations.observers.at(0)->observed, std::vector<std::string>{kType});
   EXPECT_EQ(configurations.observers.at(0)->queue->label(),
@@ -61,39 +62,32 @@ TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSecon
 }
 
 TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
+  const char* kOn = "Reporting based on being tasked-on by Statora";
+  const std::string kOff = notReporting("'TaskedOn' is false");
+  const std::string kNoDictionary = notReporting("Non-KVDictionary configuration object");
   const struct {
     std::shared_ptr<const ConfigurationValue> value;
     std::string type;
-    bool reports;
-    const char* line;
+    std::string line;
   } cases[] = {
-      {taskedOn({Number{true}}), "com.vantor.other", false,
-       "Not reporting based on not being tasked-on by Statora (unexpected type string: "
-       "'com.vantor.other')"},
-      {nullptr, kType, false,
-       "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
-      {configuration({ConfigurationValue::List{}}), kType, false,
-       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
-       "object)"},
-      {configuration({std::string("TaskedOn")}), kType, false,
-       "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
-       "object)"},
-      {configuration({Dictionary{{"taskedOn", {Number{true}}}}}), kType, false,
+      {taskedOn({Number{true}}), "com.vantor.other",
+       notReporting("unexpected type string: 'com.vantor.other'")},
+      {nullptr, kType, notReporting("nil configuration object")},
+      {configuration({ConfigurationValue::List{}}), kType, kNoDictionary},
+      {configuration({std::string("TaskedOn")}), kType, kNoDictionary},
+      {configuration({Dictionary{{"taskedOn", {Number{true}}}}}), kType,
        "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"},
-      {taskedOn({std::string("true")}), kType, false,
+      {taskedOn({std::string("true")}), kType,
        "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"},
-      {taskedOn({Number{false}}), kType, false,
-       "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
-      {taskedOn({Number{int64_t{0}}}), kType, false,
-       "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
-      {taskedOn({Number{true}}), kType, true, "Reporting based on being tasked-on by Statora"},
-      {taskedOn({Number{int64_t{1}}}), kType, true,
-       "Reporting based on being tasked-on by Statora"},
+      {taskedOn({Number{false}}), kType, kOff},
+      {taskedOn({Number{int64_t{0}}}), kType, kOff},
+      {taskedOn({Number{true}}), kType, kOn},
+      {taskedOn({Number{int64_t{1}}}), kType, kOn},
   };
   for (const auto& c : cases) {
     log.clear();
-    EXPECT_EQ(ask({{c.value, c.type}}), c.reports) << c.line;
-    EXPECT_EQ(log.lines(), std::vector<std::string>{c.line});
+    EXPECT_EQ(ask({{c.value, c.type}}), c.line == kOn) << c.line;
+    EXPECT_EQ(log.lines(), std::vector{c.line});
   }
 }
 
