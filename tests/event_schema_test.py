@@ -4,17 +4,23 @@ import copy
 import json
 import os
 import re
+import sys
 import unittest
 
-from harness import MachineTest
-from json_schema import Validator
+from harness import SKIPPED, MachineTest
 from mixed_day import mixed_day
+
+try:
+    from jsonschema import Draft202012Validator
+except ImportError:
+    print("skipped: python3-jsonschema is needed")
+    sys.exit(SKIPPED)
 
 DOCS = os.path.join(os.path.dirname(os.path.abspath(__file__)), "../docs")
 
 with open(os.path.join(DOCS, "events.schema.json"), encoding="utf-8") as file:
     SCHEMA = json.load(file)
-VALIDATOR = Validator(SCHEMA)
+VALIDATOR = Draft202012Validator(SCHEMA)
 
 
 def properties_of(name):
@@ -34,7 +40,7 @@ class SpooledRows(MachineTest):
     def check(self, rows):
         self.assertGreater(len(rows), 20)
         for name, pairs in rows:
-            self.assertEqual(VALIDATOR.errors({"name": name, "payload": dict(pairs)}), [])
+            VALIDATOR.validate({"name": name, "payload": dict(pairs)})
             keys = [key for key, _ in pairs]
             self.assertEqual(keys, [key for key in properties_of(name) if key in keys])
             if name.startswith("ts__"):
@@ -67,11 +73,11 @@ class TheSchemaItself(unittest.TestCase):
             lambda event: event["payload"].update(String1Value="week"),
             lambda event: event["payload"].update(User="someone"),
         ]
-        self.assertEqual(VALIDATOR.errors(self.EVENT), [])
+        VALIDATOR.validate(self.EVENT)
         for spoil in spoiled:
             event = copy.deepcopy(self.EVENT)
             spoil(event)
-            self.assertNotEqual(VALIDATOR.errors(event), [], event)
+            self.assertFalse(VALIDATOR.is_valid(event), event)
 
     def test_the_page_explains_every_key(self):
         with open(os.path.join(DOCS, "events.md"), encoding="utf-8") as page:

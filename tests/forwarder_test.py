@@ -171,11 +171,6 @@ class Trouble(ForwarderTest):
         self.assertEqual(self.counters()["retries"], 1)
         self.assertEqual(self.counters()["delivered"], 3)
 
-    def test_busy_collectors_are_tried_again(self):
-        for status in (502, 503, 504):
-            self.setUp()
-            self.check_retried(lambda: Answer(status), 0.4)
-
     def test_the_wait_that_the_collector_asks_for(self):
         self.check_retried(lambda: Answer(429, headers={"Retry-After": "2"}), 1.9)
         self.setUp()

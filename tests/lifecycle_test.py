@@ -91,12 +91,6 @@ class TwoProcesses(MachineTest):
         self.assertEqual(len(ends), 2)
         self.assertEqual(ends[0], len(names) // 2 - 1, "the runs must not mix")
 
-    def test_a_process_that_stays_runs_again_when_its_interval_has_passed(self):
-        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1")
-        wait_for(lambda: [name for name, _ in self.machine.rows()].count(STATISTICS) >= 3)
-        interrupt(process)
-        self.assert_clean(self.machine.result(process))
-
 
 class TwoRuns(MachineTest):
     def test_what_a_process_keeps_from_run_to_run(self):

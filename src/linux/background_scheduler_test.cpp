@@ -155,15 +155,6 @@ TEST_F(ActivityDeliveriesTest, WithAnIntervalARunComesThatLongAfterTheLastOneBeg
   EXPECT_EQ(state_.lastRun(), start + hours{25});
 }
 
-TEST_F(ActivityDeliveriesTest, AClockSetBackDelaysARunByAnIntervalAtMost) {
-  state_.recordRun(clock_.now() + hours{24 * 365});
-  const Date start = clock_.now();
-  ActivityDeliveries daily = deliveries({hours{24}, seconds{900}});
-  daily.deliverRun();
-  daily.deliverRun();
-  EXPECT_THAT(begins_, ElementsAre(start + hours{24}, start + hours{48}));
-}
-
 TEST_F(ActivityDeliveriesTest, ARunOfAnotherProcessDuringTheWaitStartsTheWaitAgain) {
   state_.recordRun(clock_.now());
   const Date otherRun = clock_.now() + hours{20};

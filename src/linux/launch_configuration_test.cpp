@@ -27,19 +27,6 @@ LaunchConfiguration configurationOf(const Variables& variables) {
   return configuration ? *configuration : LaunchConfiguration{};
 }
 
-TEST(LaunchConfigurationTest, AnEmptyEnvironmentGivesTheDefaults) {
-  const LaunchConfiguration configuration = configurationOf({});
-  EXPECT_EQ(configuration.traceStore, std::nullopt);
-  EXPECT_EQ(configuration.stateDirectory, "/var/lib/tessel");
-  EXPECT_EQ(configuration.configurationDirectory, "/etc/tessel");
-  EXPECT_EQ(configuration.activityInterval, std::nullopt);
-  EXPECT_EQ(configuration.deferRetry, std::chrono::seconds{900});
-  EXPECT_EQ(configuration.deferOn, (DeferSources{true, true, true}));
-  EXPECT_EQ(configuration.logDestination, std::nullopt);
-  EXPECT_EQ(configuration.logLevel, LogLevel::error);
-  EXPECT_EQ(configuration.osReleasePath, "/etc/os-release");
-}
-
 TEST(LaunchConfigurationTest, EveryVariableIsRead) {
   const LaunchConfiguration configuration = configurationOf({{"TESSEL_TRACE_STORE", "store"},
                                                              {"TESSEL_STATE_DIR", "/state"},
@@ -59,6 +46,8 @@ TEST(LaunchConfigurationTest, EveryVariableIsRead) {
   EXPECT_EQ(configuration.logDestination, LogDestination::standardError);
   EXPECT_EQ(configuration.logLevel, LogLevel::debug);
   EXPECT_EQ(configuration.osReleasePath, "/os-release");
+  EXPECT_EQ(configurationOf({}).deferOn, (DeferSources{true, true, true}));
+  EXPECT_EQ(configurationOf({{"TESSEL_DEFER_ON", ""}}).deferOn, DeferSources{});
 }
 
 TEST(LaunchConfigurationTest, TheManagersDirectoriesComeBeforeTheDefaultsAndAfterOurOwnVariables) {
@@ -69,10 +58,6 @@ TEST(LaunchConfigurationTest, TheManagersDirectoriesComeBeforeTheDefaultsAndAfte
   Variables both = managed;
   both["TESSEL_STATE_DIR"] = "/ours";
   EXPECT_EQ(configurationOf(both).stateDirectory, "/ours");
-}
-
-TEST(LaunchConfigurationTest, AnEmptyListDefersForNothing) {
-  EXPECT_EQ(configurationOf({{"TESSEL_DEFER_ON", ""}}).deferOn, DeferSources{});
 }
 
 TEST(LaunchConfigurationTest, ValuesThatMakeNoSenseAreNamedOnOneLine) {

@@ -24,17 +24,13 @@ std::string linesOf(LogLevel level, std::string_view text) {
   return directory.read("log");
 }
 
-TEST(StderrLogTest, OneLinePerMessageWithItsLevel) {
-  EXPECT_EQ(linesOf(LogLevel::error, "Could not"), "error: Could not\n");
-  EXPECT_EQ(linesOf(LogLevel::debug, "Checking in\n"), "debug: Checking in\n");
-  EXPECT_EQ(linesOf(LogLevel::debug, ""), "debug: \n");
-}
-
-TEST(StderrLogTest, TextOfStrangersCanNeitherStartALineNorReachTheTerminal) {
+TEST(StderrLogTest, EachMessageIsOneLineAndTextOfStrangersStartsNoneAndReachesNoTerminal) {
   const struct {
     std::string_view text;
     const char* line;
   } kCases[] = {
+      {"Checking in\n", "debug: Checking in\n"},
+      {"", "debug: \n"},
       {"Summary:\nerror: forged", "debug: Summary:\n    error: forged\n"},
       {"a\n\n", "debug: a\n    \n"},
       {"\x1b[31mred\r\x7f", "debug: \\x1b[31mred\\x0d\\x7f\n"},
@@ -45,6 +41,7 @@ TEST(StderrLogTest, TextOfStrangersCanNeitherStartALineNorReachTheTerminal) {
       {"cut \xf0\x9f", "debug: cut \\xf0\\x9f\n"},
   };
   for (const auto& [text, line] : kCases) EXPECT_EQ(linesOf(LogLevel::debug, text), line);
+  EXPECT_EQ(linesOf(LogLevel::error, "Could not"), "error: Could not\n");
 }
 
 TEST(JournalLogTest, AnEntryKeepsTheTextAndCannotLookLikeATracePoint) {

@@ -5,7 +5,6 @@
 #include "linux/IcuDates.h"
 #include "linux/MountTable.h"
 #include "linux/OsReleaseBuildVariant.h"
-#include "linux/SystemClock.h"
 #include "linux/testing/TemporaryDirectory.h"
 
 namespace tessel {
@@ -92,16 +91,6 @@ TEST(IcuDatesTest, ShortDateAndMediumTimeInLocaleAndTimeZone) {
   EXPECT_NE(IcuDates().format(date), "");
   EXPECT_EQ(IcuDates("no such locale!", "UTC").format(date), IcuDates("C", "UTC").format(date));
   EXPECT_NE(IcuDates("xx_YY", "no such zone").format(date), "");
-}
-
-TEST(SystemClockTest, TicksAreNanosecondsThatGoOn) {
-  SystemClock clock;
-  const uint64_t before = clock.continuousTicks();
-  clock.sleepMicroseconds(1);
-  EXPECT_GE(clock.continuousTicks() - before, 1000u);
-  Semaphore signalled(1);
-  EXPECT_TRUE(clock.wait(signalled, std::chrono::nanoseconds{0}));
-  EXPECT_FALSE(clock.wait(signalled, std::chrono::nanoseconds{0}));
 }
 
 }  // namespace

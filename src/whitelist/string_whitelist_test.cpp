@@ -90,6 +90,8 @@ TEST(StringWhitelistTest, MembershipIsExact) {
 
 TEST(StringWhitelistDeathTest, ASetSaysItsSizeOnceAndLumetOnEveryLookup) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(printLinesOfTwoLookups(Platform::darrow), ::testing::ExitedWithCode(0),
+              "^\\[Using string whitelist with 2 elements for Darrow platform\\]$");
   EXPECT_EXIT(printLinesOfTwoLookups(Platform::selvin), ::testing::ExitedWithCode(0),
               "^\\[Using string whitelist with 327 elements for Selvin platform\\]$");
   EXPECT_EXIT(

@@ -13,18 +13,11 @@ void RecordingLog::write(LogLevel level, std::string_view, std::string_view,
   lines_.emplace_back(level, text);
 }
 
-std::vector<std::string> RecordingLog::lines() const {
+std::vector<std::string> RecordingLog::linesUpTo(LogLevel most) const {
   const std::lock_guard lock(mutex_);
   std::vector<std::string> texts;
-  for (const auto& line : lines_) texts.push_back(line.second);
-  return texts;
-}
-
-std::vector<std::string> RecordingLog::errors() const {
-  const std::lock_guard lock(mutex_);
-  std::vector<std::string> texts;
-  for (const auto& line : lines_) {
-    if (line.first == LogLevel::error) texts.push_back(line.second);
+  for (const auto& [level, text] : lines_) {
+    if (level <= most) texts.push_back(text);
   }
   return texts;
 }
@@ -58,21 +51,12 @@ bool FakeClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
   return false;
 }
 
-void ManualQueue::sync(const Closure& work) {
-  runAll();
-  work();
-}
-
 void ManualQueue::runAll() {
   while (!work_.empty()) {
     const Closure work = std::move(work_.front());
     work_.pop_front();
     work();
   }
-}
-
-std::shared_ptr<SerialQueue> ManualQueueFactory::makeSerialQueue(std::string label) {
-  return queues.emplace_back(std::make_shared<ManualQueue>(std::move(label)));
 }
 
 std::shared_ptr<RepeatingTimer> ManualQueueFactory::makeRepeatingTimer(
@@ -84,16 +68,6 @@ std::shared_ptr<RepeatingTimer> ManualQueueFactory::makeRepeatingTimer(
   timer->leeway = leeway;
   timer->handler = std::move(handler);
   return timers.emplace_back(std::move(timer));
-}
-
-void ManualQueueFactory::runAll() {
-  for (const auto& queue : queues) queue->runAll();
-}
-
-bool FakeActivity::setState(int64_t wanted) {
-  statesSet.push_back(wanted);
-  if (takesStates) currentState = wanted;
-  return takesStates;
 }
 
 std::unique_ptr<KeepAliveTransaction> FakeRuntime::openTransaction(const std::string& name) {
@@ -110,22 +84,10 @@ std::unique_ptr<KeepAliveTransaction> FakeRuntime::openTransaction(const std::st
 
 void FakeRuntime::runMainLoop() { throw std::logic_error("the fake runtime has no main loop"); }
 
-bool RememberingSender::sendEvent(std::string_view name, const Payload& payload) {
-  if (takesEvents) events.push_back({std::string(name), payloadJson(payload)});
-  return takesEvents;
-}
-
 std::vector<std::string> RememberingSender::names() const {
   std::vector<std::string> all;
   for (const SentEvent& event : events) all.push_back(event.name);
   return all;
-}
-
-void FakeConfigurationObserver::setDelegate(
-    std::shared_ptr<ConfigurationObserverDelegate> delegateIn,
-    std::shared_ptr<SerialQueue> queueIn) {
-  delegate = std::move(delegateIn);
-  queue = std::move(queueIn);
 }
 
 void FakeConfigurationObserver::deliver(std::shared_ptr<const ConfigurationValue> configuration,
@@ -135,18 +97,10 @@ void FakeConfigurationObserver::deliver(std::shared_ptr<const ConfigurationValue
   });
 }
 
-std::shared_ptr<ConfigurationObserver> FakeConfigurationService::makeObserver() {
-  return observers.emplace_back(std::make_shared<FakeConfigurationObserver>());
-}
-
 FileExistence FakeFiles::existence(const std::string& path) {
   const auto item = items.find(path);
   if (item == items.end()) return {};
   return {true, item->second};
-}
-
-bool FakeFiles::createFile(const std::string& path) {
-  return canCreate && items.emplace(path, false).second;
 }
 
 RemovalResult FakeFiles::remove(const std::string& path) {
@@ -160,17 +114,6 @@ std::optional<std::string> FakeBundles::bundleIdentifier(const std::string& dire
   const auto found = identifiers.find(directory);
   if (found == identifiers.end()) return {};
   return found->second;
-}
-
-bool FakeBuildVariant::hasInternalDiagnostics(std::string_view subsystem) {
-  ++asked;
-  lastSubsystem = subsystem;
-  return internal;
-}
-
-std::string FakeDates::format(Date date) {
-  return std::to_string(
-      std::chrono::duration_cast<std::chrono::seconds>(date.time_since_epoch()).count());
 }
 
 }  // namespace tessel::testing

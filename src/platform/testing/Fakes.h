@@ -29,13 +29,15 @@ class RecordingLog final : public LogSink {
 
   void write(LogLevel level, std::string_view subsystem, std::string_view category,
              std::string_view text) override;
-  std::vector<std::string> lines() const;
-  std::vector<std::string> errors() const;
+  std::vector<std::string> lines() const { return linesUpTo(LogLevel::debug); }
+  std::vector<std::string> errors() const { return linesUpTo(LogLevel::error); }
   // How many lines read exactly `text`.
   size_t count(std::string_view text) const;
   void clear();
 
  private:
+  std::vector<std::string> linesUpTo(LogLevel most) const;
+
   mutable std::mutex mutex_;
   std::vector<std::pair<LogLevel, std::string>> lines_;
 };
@@ -65,7 +67,10 @@ class ManualQueue final : public SerialQueue {
   explicit ManualQueue(std::string label) : label_(std::move(label)) {}
   const std::string& label() const override { return label_; }
   void async(Closure work) override { work_.push_back(std::move(work)); }
-  void sync(const Closure& work) override;
+  void sync(const Closure& work) override {
+    runAll();
+    work();
+  }
   // Runs what is queued, and what that queues.
   void runAll();
   size_t pending() const { return work_.size(); }
@@ -88,12 +93,16 @@ struct ManualTimer final : RepeatingTimer {
 };
 
 struct ManualQueueFactory final : QueueFactory {
-  std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;
+  std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override {
+    return queues.emplace_back(std::make_shared<ManualQueue>(std::move(label)));
+  }
   std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
                                                      std::chrono::nanoseconds interval,
                                                      std::chrono::nanoseconds leeway,
                                                      Closure handler) override;
-  void runAll();
+  void runAll() {
+    for (const auto& queue : queues) queue->runAll();
+  }
 
   std::vector<std::shared_ptr<ManualQueue>> queues;
   std::vector<std::shared_ptr<ManualTimer>> timers;
@@ -102,7 +111,11 @@ struct ManualQueueFactory final : QueueFactory {
 struct FakeActivity final : Activity {
   int64_t state() override { return currentState; }
   bool shouldDefer() override { return deferWanted; }
-  bool setState(int64_t wanted) override;
+  bool setState(int64_t wanted) override {
+    statesSet.push_back(wanted);
+    if (takesStates) currentState = wanted;
+    return takesStates;
+  }
 
   int64_t currentState = kActivityStateRun;
   bool deferWanted = false;
@@ -138,16 +151,21 @@ struct SentEvent {
 
 // An analytics service that remembers.
 struct RememberingSender final : EventSender {
-  bool sendEvent(std::string_view name, const Payload& payload) override;
+  bool sendEvent(std::string_view name, const Payload& payload) override {
+    events.push_back({std::string(name), payloadJson(payload)});
+    return true;
+  }
   std::vector<std::string> names() const;
 
   std::vector<SentEvent> events;
-  bool takesEvents = true;
 };
 
 struct FakeConfigurationObserver final : ConfigurationObserver {
   void setDelegate(std::shared_ptr<ConfigurationObserverDelegate> delegateIn,
-                   std::shared_ptr<SerialQueue> queueIn) override;
+                   std::shared_ptr<SerialQueue> queueIn) override {
+    delegate = std::move(delegateIn);
+    queue = std::move(queueIn);
+  }
   void startObserving(const std::string& type) override { observed.push_back(type); }
   // Submits one call to the delegate on its queue.
   void deliver(std::shared_ptr<const ConfigurationValue> configuration, std::string type);
@@ -158,13 +176,17 @@ struct FakeConfigurationObserver final : ConfigurationObserver {
 };
 
 struct FakeConfigurationService final : ConfigurationService {
-  std::shared_ptr<ConfigurationObserver> makeObserver() override;
+  std::shared_ptr<ConfigurationObserver> makeObserver() override {
+    return observers.emplace_back(std::make_shared<FakeConfigurationObserver>());
+  }
   std::vector<std::shared_ptr<FakeConfigurationObserver>> observers;
 };
 
 struct FakeFiles final : FileManager {
   FileExistence existence(const std::string& path) override;
-  bool createFile(const std::string& path) override;
+  bool createFile(const std::string& path) override {
+    return canCreate && items.emplace(path, false).second;
+  }
   RemovalResult remove(const std::string& path) override;
 
   std::map<std::string, bool> items;  // path to "is a directory"
@@ -184,7 +206,11 @@ struct FakeBundles final : BundleReader {
 };
 
 struct FakeBuildVariant final : BuildVariant {
-  bool hasInternalDiagnostics(std::string_view subsystem) override;
+  bool hasInternalDiagnostics(std::string_view subsystem) override {
+    ++asked;
+    lastSubsystem = subsystem;
+    return internal;
+  }
   bool internal = false;
   size_t asked = 0;
   std::string lastSubsystem;
@@ -192,7 +218,10 @@ struct FakeBuildVariant final : BuildVariant {
 
 // Formats a date as its seconds since 1970.
 struct FakeDates final : DateFormatter {
-  std::string format(Date date) override;
+  std::string format(Date date) override {
+    const auto since1970 = date.time_since_epoch();
+    return std::to_string(std::chrono::duration_cast<std::chrono::seconds>(since1970).count());
+  }
 };
 
 }  // namespace tessel::testing

@@ -35,11 +35,6 @@ struct ScriptedCollector final : Collector {
   }
 };
 
-struct SilentStatus final : ServiceStatus {
-  void say(std::string_view) override {}
-  void progress() override {}
-};
-
 class ForwarderTest : public ::testing::Test {
  protected:
   ForwarderTest() {
@@ -88,7 +83,7 @@ class ForwarderTest : public ::testing::Test {
   testing::FakeClock clock_;
   testing::RecordingLog log_;
   ScriptedCollector collector_;
-  SilentStatus status_;
+  testing::FakeServiceStatus status_;
   Semaphore stop_{0};
   ForwarderOptions options_;
   ForwarderState state_{directory_.path()};
