@@ -78,15 +78,6 @@ class Store(MachineTest):
         self.assertEqual(len(payloads), 1)
         self.assertAlmostEqual(payloads[0]["DurationInSeconds"], 60, delta=10)
 
-    def test_many_writers_lose_nothing(self):
-        script = ('for i in $(seq 20); do "$0" record event com.vantor.Calendar View "W$1-$i" --telemetry '
-                  '--store "$2" || exit 1; done')
-        writers = [subprocess.Popen(["sh", "-c", script, CTL, str(writer), self.machine.store]) for writer in range(4)]
-        self.assertEqual([writer.wait() for writer in writers], [0] * 4)
-        self.assert_clean(self.machine.run())
-        self.assertEqual(sorted(sent(self.machine)),
-                         sorted(("Event", f"W{writer}-{i}") for writer in range(4) for i in range(1, 21)))
-
 
 class CommandLine(unittest.TestCase):
     def test_what_cannot_be_recorded_is_named(self):

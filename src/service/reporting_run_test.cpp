@@ -1,5 +1,6 @@
 // A whole run over fakes: its order, its exits, the deferral, the books.
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "objects/testing/TestObjects.h"
@@ -9,6 +10,7 @@
 namespace tessel {
 namespace {
 
+using ::testing::ElementsAre;
 using testing::makeAnimationInterval;
 using testing::makeEvent;
 using testing::makeInterval;
@@ -67,23 +69,20 @@ class ReportingRunTest : public ::testing::Test {
 TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
   extractor->duringProcessing = [this] { EXPECT_TRUE(files.items.contains(cookieFilePath)); };
   perform();
-  EXPECT_EQ(linesBeforeSummary(),
-            (std::vector<std::string>{"Reporting based on os_flavor result", "Created cookie file",
-                                      "(extractor made)", "Filesystem for '/': ext4",
-                                      "Boot disk type: SSD"}));
+  EXPECT_THAT(linesBeforeSummary(),
+              ElementsAre("Reporting based on os_flavor result", "Created cookie file",
+                          "(extractor made)", "Filesystem for '/': ext4", "Boot disk type: SSD"));
   EXPECT_EQ(log.lines().back(), "Cleared cookie file");
-  EXPECT_EQ(extractor->calls,
-            (std::vector<std::string>{"interval callback", "animation callback", "event callback",
-                                      "composite off", "process"}));
+  EXPECT_THAT(extractor->calls, ElementsAre("interval callback", "animation callback",
+                                            "event callback", "composite off", "process"));
   EXPECT_EQ(extractor->processedPath, std::nullopt);
   EXPECT_EQ(extractor->endDate - extractor->startDate, std::chrono::hours{24});
   EXPECT_EQ(extractor->endDate, clock.date);
   EXPECT_FALSE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(activity->statesSet.empty());
   EXPECT_EQ(reports.at(0).ending, RunEnding::completed);
-  EXPECT_EQ(status.said,
-            (std::vector<std::string>{"waiting for the tasking configuration",
-                                      "reading the trace store", "summarising", "idle"}));
+  EXPECT_THAT(status.said, ElementsAre("waiting for the tasking configuration",
+                                       "reading the trace store", "summarising", "idle"));
 }
 
 TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsAndOneWithoutANameAsOneBeforeTheSummary) {
@@ -124,10 +123,10 @@ TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
 TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
   files.items[cookieFilePath] = true;
   perform();
-  EXPECT_EQ(log.lines(), (std::vector<std::string>{
-                             "Reporting based on os_flavor result",
-                             "Cookie file exists but is directory", "Bailing due to cookie file",
-                             "Cookie file exists but is directory", "Cleared cookie file"}));
+  EXPECT_THAT(log.lines(),
+              ElementsAre("Reporting based on os_flavor result",
+                          "Cookie file exists but is directory", "Bailing due to cookie file",
+                          "Cookie file exists but is directory", "Cleared cookie file"));
   EXPECT_TRUE(sender.events.empty());
   perform();
   EXPECT_EQ(sender.names().back(), "com.vantor.performance.tessel_reporting_stats");
@@ -149,9 +148,8 @@ TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
   files.items.clear();
   files.removal = RemovalResult{false, {}};
   perform();
-  EXPECT_EQ(log.errors(),
-            (std::vector<std::string>{"Could not clear cookie file: Permission denied",
-                                      "Could not clear cookie file: Unknown error"}));
+  EXPECT_THAT(log.errors(), ElementsAre("Could not clear cookie file: Permission denied",
+                                        "Could not clear cookie file: Unknown error"));
 }
 
 TEST_F(ReportingRunTest, AMarkerThatIsGoneIsNotClearedAndOneThatIsThereIsNotMade) {
@@ -218,8 +216,7 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
   perform();
   EXPECT_EQ(log.count("Trying to stop in-flight reporting work."), 1u);
   EXPECT_EQ(log.count("Concluding processing due to deferral request"), 1u);
-  EXPECT_EQ(sender.names(),
-            std::vector<std::string>{"com.vantor.performance.tessel_reporting_stats"});
+  EXPECT_THAT(sender.names(), ElementsAre("com.vantor.performance.tessel_reporting_stats"));
   EXPECT_NE(sender.events.back().json.find("\"WasInterrupted\":true"), std::string::npos);
   EXPECT_TRUE(activity->statesSet.empty());
   EXPECT_TRUE(reports.at(0).interruptedByDeferral);
@@ -239,14 +236,13 @@ TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   queues.timers.back()->fire();
   activity->deferWanted = true;
   queues.runAll();
-  EXPECT_EQ(log.lines(),
-            (std::vector<std::string>{"Trying to stop in-flight reporting work.",
-                                      "Concluding processing due to deferral request"}));
+  EXPECT_THAT(log.lines(), ElementsAre("Trying to stop in-flight reporting work.",
+                                       "Concluding processing due to deferral request"));
   activity->deferWanted = false;
   log.clear();
   queues.timers.back()->fire();
   queues.runAll();
-  EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferral not requested, continuing."});
+  EXPECT_THAT(log.lines(), ElementsAre("Deferral not requested, continuing."));
 }
 
 TEST_F(ReportingRunTest, FivePairsOfEachSectionAreSentAndTheRestOnlyCounted) {
@@ -360,15 +356,15 @@ TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTrans
     handle();
     EXPECT_EQ(runtime.calls, aroundEverything);
   }
-  EXPECT_EQ(log.lines(), (std::vector<std::string>{"Checking in\n", "Unknown state 1\n",
-                                                   "Unknown state 3\n", "Unknown state -5\n"}));
+  EXPECT_THAT(log.lines(), ElementsAre("Checking in\n", "Unknown state 1\n", "Unknown state 3\n",
+                                       "Unknown state -5\n"));
   EXPECT_TRUE(reports.empty());
 }
 
 TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
   activity->deferWanted = true;
   handle();
-  EXPECT_EQ(log.lines(), std::vector<std::string>{"Deferred tessel_reporter\n"});
+  EXPECT_THAT(log.lines(), ElementsAre("Deferred tessel_reporter\n"));
   EXPECT_EQ(activity->statesSet, std::vector<int64_t>{3});
   EXPECT_EQ(runtime.calls, aroundEverything);
   EXPECT_EQ(variant.asked, 0u);

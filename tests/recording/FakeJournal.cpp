@@ -55,18 +55,10 @@ int passedDescriptor(msghdr& message) {
 }  // namespace
 
 std::string JournalEntry::operator[](const std::string& name) const {
-  std::string all;
   for (const auto& [key, value] : fields) {
-    if (key == name) all += (all.empty() ? "" : "|") + value;
+    if (key == name) return value;
   }
-  return all;
-}
-
-bool JournalEntry::has(const std::string& name) const {
-  for (const auto& field : fields) {
-    if (field.first == name) return true;
-  }
-  return false;
+  return kNone;
 }
 
 FakeJournal::FakeJournal() {

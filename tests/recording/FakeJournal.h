@@ -12,9 +12,9 @@ struct JournalEntry {
   bool wasFile = false;                                     // came as a memory file
   int seals = 0;                                            // of that file
 
-  // All values of a field, joined by '|'; empty where there is none.
+  static constexpr const char* kNone = "(none)";
+  // The first value of a field; kNone where there is none.
   std::string operator[](const std::string& name) const;
-  bool has(const std::string& name) const;
 };
 
 class FakeJournal {
@@ -29,7 +29,6 @@ class FakeJournal {
   // Takes the socket away, as a daemon that ends; and puts up a new one.
   void stop();
   void start();
-  const std::string& path() const { return path_; }
 
  private:
   std::string directory_;

@@ -68,11 +68,10 @@ class LiveJournal(unittest.TestCase):
                 self.assertGreater(float(entries[2]["TESSEL_DURATION"]), 0)
                 self.assertEqual(entries[4]["TESSEL_FRAME_RATE"], "59.94")
 
-    def test_python_example(self):
-        self.check_example(os.path.join(OPTIONS.sources, "record.py"))
-
-    def test_shell_example(self):
-        self.check_example(os.path.join(OPTIONS.sources, "record.sh"))
+    def test_script_examples(self):
+        for script in ("record.py", "record.sh"):
+            with self.subTest(script):
+                self.check_example(os.path.join(OPTIONS.sources, script))
 
 
 if __name__ == "__main__":

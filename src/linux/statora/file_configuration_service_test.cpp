@@ -115,8 +115,11 @@ TEST_F(FileConfigurationServiceTest, AReplacedDirectoryAndReplacedLinksAreFollow
     std::filesystem::create_directory(directory_.path(name));
     directory_.write(std::string(name) + "/" + kFile, std::string(R"({"v":")") + name + "\"}");
   }
-  std::filesystem::create_directory_symlink("a", directory_.path("config"));
+  std::filesystem::create_directory(directory_.path("config"));
   observe(directory_.path("config"));
+  EXPECT_EQ(delegate_->next(kQuiet), "none");
+  std::filesystem::remove(directory_.path("config"));
+  std::filesystem::create_directory_symlink("a", directory_.path("config"));
   EXPECT_EQ(delegate_->next(), "a");
   std::filesystem::create_directory_symlink("b", directory_.path("link"));
   std::filesystem::rename(directory_.path("link"), directory_.path("config"));

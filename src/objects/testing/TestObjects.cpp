@@ -6,64 +6,62 @@ namespace tessel::testing {
 
 namespace {
 
-StringRef internText(StringPool& pool, const TestPoint::Text& text) {
-  return text ? pool.intern(*text) : StringRef();
-}
-
-TracePointFields fieldsOf(const TestPoint& point, const std::shared_ptr<StringPool>& pool) {
-  TracePointFields fields;
-  fields.strings = pool;
-  fields.subsystem = internText(*pool, point.subsystem);
-  fields.category = internText(*pool, point.category);
-  fields.name = internText(*pool, point.name);
-  fields.string1Name = internText(*pool, point.string1Name);
-  fields.string1Value = internText(*pool, point.string1Value);
-  fields.string2Name = internText(*pool, point.string2Name);
-  fields.string2Value = internText(*pool, point.string2Value);
-  fields.number1Name = internText(*pool, point.number1Name);
-  fields.number1Value = point.number1Value;
-  fields.number2Name = internText(*pool, point.number2Name);
-  fields.number2Value = point.number2Value;
-  fields.durationSeconds = point.durationSeconds;
-  fields.telemetryEnabled = point.telemetryEnabled;
-  return fields;
-}
-
-IntervalFields intervalOf(const TestPoint& point, StringPool& pool) {
-  IntervalFields interval;
-  interval.beginEvent = {internText(pool, point.beginImagePath),
-                         internText(pool, point.beginProcessName)};
-  interval.endEvent = {internText(pool, point.endImagePath),
-                       internText(pool, point.endProcessName)};
-  for (const auto& [key, value] : point.attributes) {
-    interval.attributes.emplace_back(pool.intern(key), pool.intern(value));
+// The texts of one object, in a pool of its own, as if each came from another extraction.
+struct Texts {
+  StringRef operator()(const TestPoint::Text& text) const {
+    return text ? pool->intern(*text) : StringRef();
   }
+  std::shared_ptr<StringPool> pool = std::make_shared<StringPool>();
+};
+
+TracePointFields fieldsOf(const TestPoint& point, const Texts& texts) {
+  return {.strings = texts.pool,
+          .subsystem = texts(point.subsystem),
+          .category = texts(point.category),
+          .name = texts(point.name),
+          .string1Name = texts(point.string1Name),
+          .string1Value = texts(point.string1Value),
+          .string2Name = texts(point.string2Name),
+          .string2Value = texts(point.string2Value),
+          .number1Name = texts(point.number1Name),
+          .number1Value = point.number1Value,
+          .number2Name = texts(point.number2Name),
+          .number2Value = point.number2Value,
+          .durationSeconds = point.durationSeconds,
+          .telemetryEnabled = point.telemetryEnabled};
+}
+
+EmittingProcess beginOf(const TestPoint& point, const Texts& texts) {
+  return {texts(point.beginImagePath), texts(point.beginProcessName)};
+}
+
+IntervalFields intervalOf(const TestPoint& point, const Texts& texts) {
+  IntervalFields interval{
+      beginOf(point, texts), {texts(point.endImagePath), texts(point.endProcessName)}, {}};
+  for (const auto& [key, value] : point.attributes)
+    interval.attributes.emplace_back(texts(key), texts(value));
   return interval;
 }
 
 }  // namespace
 
 std::shared_ptr<const TesselObject> makeObject(const TestPoint& point) {
-  return std::make_shared<TesselObject>(fieldsOf(point, std::make_shared<StringPool>()));
+  return std::make_shared<TesselObject>(fieldsOf(point, {}));
 }
 
 std::shared_ptr<const TesselEvent> makeEvent(const TestPoint& point) {
-  auto pool = std::make_shared<StringPool>();
-  const EmittingProcess process{internText(*pool, point.beginImagePath),
-                                internText(*pool, point.beginProcessName)};
-  return std::make_shared<TesselEvent>(fieldsOf(point, pool), process);
+  const Texts texts;
+  return std::make_shared<TesselEvent>(fieldsOf(point, texts), beginOf(point, texts));
 }
 
 std::shared_ptr<const TesselInterval> makeInterval(const TestPoint& point) {
-  auto pool = std::make_shared<StringPool>();
-  auto interval = intervalOf(point, *pool);
-  return std::make_shared<TesselInterval>(fieldsOf(point, pool), std::move(interval));
+  const Texts texts;
+  return std::make_shared<TesselInterval>(fieldsOf(point, texts), intervalOf(point, texts));
 }
 
 std::shared_ptr<const TesselAnimationInterval> makeAnimationInterval(const TestPoint& point) {
-  auto pool = std::make_shared<StringPool>();
-  auto interval = intervalOf(point, *pool);
-  return std::make_shared<TesselAnimationInterval>(fieldsOf(point, pool), std::move(interval),
+  const Texts texts;
+  return std::make_shared<TesselAnimationInterval>(fieldsOf(point, texts), intervalOf(point, texts),
                                                    point.frameRate);
 }
 
