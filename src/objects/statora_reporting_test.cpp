@@ -126,6 +126,21 @@ TEST_F(StatoraReportingTest, TheOverrideIsTakenWhereItIsMeant) {
   }
 }
 
+TEST(TesselClassTest, AnObjectIsOfItsClassAndOfThoseItDerivesFrom) {
+  using Answers = std::vector<bool>;  // support object, object, event, interval, animation interval
+  const auto answersOf = [](const TesselSupportObject& object) {
+    Answers answers;
+    for (int kind = 0; kind < 5; ++kind)
+      answers.push_back(object.isKindOf(static_cast<TesselClass>(kind)));
+    return answers;
+  };
+  EXPECT_EQ(answersOf(TesselSupportObject()), (Answers{true, false, false, false, false}));
+  EXPECT_EQ(answersOf(*makeObject({})), (Answers{true, true, false, false, false}));
+  EXPECT_EQ(answersOf(*makeEvent({})), (Answers{true, true, true, false, false}));
+  EXPECT_EQ(answersOf(*makeInterval({})), (Answers{true, true, false, true, false}));
+  EXPECT_EQ(answersOf(*makeAnimationInterval({})), (Answers{true, true, false, true, true}));
+}
+
 TEST(TesselReporterPlatformTest, NamesAndCodesBelongTogether) {
   for (uint64_t code = 0; code <= 5; ++code) {
     const auto platform = static_cast<TesselReporterPlatform>(code);
