@@ -235,7 +235,10 @@ TEST(DefaultDownsamplingTest, TheTablesHoldTheirRows) {
   for (const Path& path : {footprint, mail, batch})
     EXPECT_EQ(rowFor(TesselReporterPlatform::selvin, path), Row({0, 1})) << *path.name;
   batch.subsystem = mail.subsystem;
-  EXPECT_EQ(rowFor(TesselReporterPlatform::selvin, batch), std::nullopt);
+  Path other = footprint;
+  other.name = "Other";
+  for (const Path& path : {batch, other})
+    EXPECT_EQ(rowFor(TesselReporterPlatform::selvin, path), std::nullopt) << *path.name;
   EXPECT_EQ(rowFor(TesselReporterPlatform::quarro, footprint), Row({0, 503}));
   EXPECT_EQ(rowFor(TesselReporterPlatform::quarro, text), std::nullopt);
   EXPECT_EQ(defaultSelvinConfiguration().size(), 4u);
