@@ -11,7 +11,7 @@ import subprocess
 import time
 
 import harness
-from harness import BIN, TASKING, MachineTest, log_event, point
+from harness import BIN, TASKING, Entry, MachineTest, export_bytes, log_event, point
 from otlp_receiver import Answer, Receiver
 
 HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "%s%n%llu", "two\nlines", "tab\tand\rreturn",
@@ -289,6 +289,58 @@ class Status(CtlTest):
             exit_status, status = self.status()
             self.assertEqual((exit_status, status["good"]), (1, False), changes)
             self.assertEqual(self.machine.ctl("status").status, 1)
+
+    def test_what_the_store_of_the_last_run_had_lost_is_told(self):
+        self.machine.write_export([log_event("old", at=-90000), point("event", "com.vantor.A", "x", "One")])
+        self.assert_clean(self.machine.run())
+        self.assertRegex(self.machine.ctl("status").out, r"Store +whole +1 file and 1 entry read\n\S")
+
+        self.machine.write_export([log_event("plain", at=-90), point("event", "com.vantor.A", "x", "Two", exe=None)])
+        self.machine.write_export([Entry([("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
+                                          ("OBJECT_SYSTEMD_UNIT", "vantor.service")], at=-30)], "b.export",
+                                  first_sequence=10)
+        damaged, refused = (os.path.join(self.machine.store, name) for name in ("c.export", "\x1bd.journal"))
+        with open(damaged, "wb") as file:
+            file.write(b"no equals sign\n\n")
+            file.writelines(export_bytes([log_event("after it", at=-20)], self.machine.now, first_sequence=11))
+        with open(refused, "wb") as file:
+            file.write(b"this is a letter" * 64)
+        self.assert_clean(self.machine.run())
+        summary = json.loads(self.machine.ctl("explain", "--summary", "--json").out)
+        exit_status, status = self.status()
+        self.assertEqual((exit_status, status["good"]), (0, True), "losses of the store are none of the reporter")
+        reading = status["last_run"]["reading"]
+        for told in (reading, summary):
+            self.assertTrue(told["store"].pop("range_start"))  # of a moment of its own
+        for key in ("store", "malformed", "beyond_pair_limit", "without_exe"):
+            self.assertEqual(reading[key], summary[key])
+        self.assertEqual((reading["store"]["missing"], reading["store"]["dropped"], reading["without_exe"]),
+                         (7, [{"unit": "vantor.service", "count": 7}], 1))
+        files = {file["path"]: file for file in summary["files"]}
+        self.assertEqual(reading["files"], [{"path": refused.replace("\x1b", "\\x1b"), "skipped": files[refused]["skipped"]}])
+        self.assertEqual(reading["problems"], [{"path": damaged, "files": 1, **problem}
+                                               for problem in files[damaged]["problems"]])
+        text = re.sub(r"\s+", " ", self.machine.ctl("status").out)
+        for words in ("Store not whole 3 files and 4 entries read The store reaches back to", "7 entries, by 1 gap in",
+                      "7 entries that the journal daemon dropped, of vantor.service", "1 _EXE of trace points",
+                      f"not read: {files[refused]['skipped']}", "\\x1bd.journal",
+                      f"{files[damaged]['problems'][0]['reason']}, 1 time, first at byte 0 of"):
+            self.assertIn(words, text)
+
+    def test_a_record_without_a_reading_says_nothing_of_the_store(self):
+        self.run_once()
+        self.change_record(reading=None)
+        self.assertNotIn("last_run", self.status()[1], "a damaged record is none")
+        self.run_once()
+        with open(self.record(), encoding="utf-8") as file:
+            record = json.load(file)
+        del record["reading"]
+        with open(self.record(), "w", encoding="utf-8") as file:
+            json.dump(record, file)
+        self.assertNotIn("reading", self.status()[1]["last_run"])
+        shown = self.machine.ctl("status")
+        self.assert_clean(shown)
+        self.assertNotIn("Store", shown.out)
 
     def test_it_says_what_the_next_run_will_meet(self):
         self.machine.write_export([log_event("old", at=-90000), log_event("new")])

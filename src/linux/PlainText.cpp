@@ -55,6 +55,20 @@ std::string plainText(std::string_view text, std::string_view lineFeed) {
   return out;
 }
 
+std::string shortPlainText(std::string_view text, size_t maximum) {
+  constexpr std::string_view kLeftOut = "...";
+  std::string plain = plainText(text, "\\x0a");
+  if (plain.size() <= maximum) return plain;
+  const auto insideCharacter = [&](size_t at) {
+    return (static_cast<unsigned char>(plain[at]) & 0xc0) == 0x80;
+  };
+  size_t head = maximum / 4;
+  size_t tail = plain.size() - (maximum - head - kLeftOut.size());
+  while (insideCharacter(head)) --head;
+  while (tail < plain.size() && insideCharacter(tail)) ++tail;
+  return plain.substr(0, head).append(kLeftOut).append(plain, tail);
+}
+
 std::string_view trimmed(std::string_view text, std::string_view blanks) {
   const size_t begin = text.find_first_not_of(blanks);
   if (begin == std::string_view::npos) return {};

@@ -9,6 +9,7 @@
 #include <numeric>
 
 #include "linux/DurableFile.h"
+#include "linux/PlainText.h"
 
 namespace tessel {
 
@@ -18,6 +19,7 @@ using OrderedJson = nlohmann::ordered_json;
 
 constexpr const char* kOutcomes[] = {"completed", "interrupted", "bailed_out", "failed"};
 constexpr size_t kMaxRecordBytes = size_t{1} << 20;
+constexpr size_t kMaxFailureBytes = 1024;
 
 std::string recordPath(const std::string& stateDirectory) {
   return stateDirectory + "/last_run.json";
@@ -61,6 +63,7 @@ RunRecord recordFrom(const OrderedJson& json) {
   record.rowsFailed = namedFrom(json.at("rows_failed"));
   record.setAside = json.at("set_aside").get<std::vector<std::string>>();
   record.store = namedFrom(json.at("store"));
+  if (json.contains("reading")) record.reading = digestFrom(json.at("reading"));
   record.marker = json.at("marker").get<std::string>();
   return record;
 }
@@ -68,6 +71,24 @@ RunRecord recordFrom(const OrderedJson& json) {
 }  // namespace
 
 const char* runOutcomeName(RunOutcome outcome) { return kOutcomes[static_cast<size_t>(outcome)]; }
+
+void RunRecord::addReading(const ExtractionReport& found) {
+  const ReadingDigest digest = digestOf(found);
+  const std::vector<FileReport>& files = found.store.files;
+  const auto damaged = std::count_if(files.begin(), files.end(),
+                                     [](const FileReport& file) { return !file.problems.empty(); });
+  uint64_t malformed = 0;
+  for (const auto& [reason, count] : digest.malformed) malformed += count;
+  logEvents = found.entriesRead;
+  store = {{"files", files.size()},
+           {"files_skipped", digest.store.files.size() + digest.filesNotListed},
+           {"files_damaged", static_cast<uint64_t>(damaged)},
+           {"entries_missing", digest.store.missingEntries},
+           {"malformed", malformed},
+           {"open_intervals_dropped", digest.droppedOpenIntervals},
+           {"beyond_pair_limit", digest.beyondPairLimit}};
+  if (!files.empty()) reading = digest;
+}
 
 bool RunRecord::objectsBalance() const {
   return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
@@ -84,7 +105,7 @@ std::optional<std::string> RunRecord::write(const std::string& stateDirectory) c
   json["start"] = microseconds(start);
   json["end"] = microseconds(end);
   json["outcome"] = runOutcomeName(outcome);
-  json["failure"] = failure;
+  json["failure"] = shortPlainText(failure, kMaxFailureBytes);
   json["log_events"] = logEvents;
   json["inspected"] = inspected;
   json["classified"] = classified;
@@ -94,6 +115,7 @@ std::optional<std::string> RunRecord::write(const std::string& stateDirectory) c
   json["rows_failed"] = named(rowsFailed);
   json["set_aside"] = setAside;
   json["store"] = named(store);
+  if (reading) json["reading"] = digestJson(*reading);
   json["marker"] = marker;
   // Words of the system are not always UTF-8.
   const std::string text = json.dump(1, ' ', false, OrderedJson::error_handler_t::replace);

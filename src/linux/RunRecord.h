@@ -13,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "linux/ReadingDigest.h"
 #include "platform/Clock.h"
 
 namespace tessel {
@@ -41,8 +42,13 @@ struct RunRecord {
   uint64_t rowsStored = 0;   // in the spool
   Named rowsFailed;          // by reason; kept without those that are zero
   std::vector<std::string> setAside;  // damaged spools, by file name
-  Named store;                        // facts about the trace store, by name, in order
-  std::string marker;                 // what became of the run marker, in words
+  Named store;                        // sums about the trace store, by name, in order
+  // Absent where nothing was read, and in records of a service that did not keep it.
+  std::optional<ReadingDigest> reading;
+  std::string marker;  // what became of the run marker, in words
+
+  // Takes over what the reader found: the entries, the sums and the reading.
+  void addReading(const ExtractionReport& found);
 
   // Whether every inspected object has exactly one classification.
   bool objectsBalance() const;
@@ -52,7 +58,8 @@ struct RunRecord {
   // it has no name, the counts, the summary.
   bool rowsBalance() const;
 
-  // The reason in words where the record cannot be written.
+  // Less than 64 KiB, whatever the store looked like. The reason in words where that cannot be
+  // written.
   std::optional<std::string> write(const std::string& stateDirectory) const;
   // Nothing where there is no record or it cannot be understood.
   static std::optional<RunRecord> read(const std::string& stateDirectory);

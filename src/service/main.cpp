@@ -83,25 +83,6 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
   }
 }
 
-void addStore(RunRecord& record, const ExtractionReport& found) {
-  uint64_t malformed = 0;
-  for (const uint64_t count : found.assembly.malformed) malformed += count;
-  uint64_t skipped = 0;
-  uint64_t damaged = 0;
-  for (const FileReport& file : found.store.files) {
-    skipped += file.skipped && !file.outsideRange ? 1 : 0;
-    damaged += file.problems.empty() ? 0 : 1;
-  }
-  record.logEvents = found.entriesRead;
-  record.store = {{"files", found.store.files.size()},
-                  {"files_skipped", skipped},
-                  {"files_damaged", damaged},
-                  {"entries_missing", found.store.missingEntries},
-                  {"malformed", malformed},
-                  {"open_intervals_dropped", found.assembly.droppedOpenIntervals},
-                  {"beyond_pair_limit", found.beyondPairLimit}};
-}
-
 RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
   RunRecord record;
   record.start = report.began;
@@ -114,7 +95,7 @@ RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
   if (report.filter) addObjects(record, *report.filter);
   // The run's extractor is the one that makeRun() hands out.
   if (report.extractor)
-    addStore(record, static_cast<const JournalExtractor&>(*report.extractor).report());
+    record.addReading(static_cast<const JournalExtractor&>(*report.extractor).report());
   record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
   addRows(record, figures);
   return record;

@@ -29,13 +29,20 @@ void logFiles(const StoreReport& store) {
 
 }  // namespace
 
+MalformedCounts malformedCounts(const ExtractionReport& report) {
+  MalformedCounts counts;
+  for (size_t reason = 0; reason < kMalformedReasons; ++reason) {
+    const uint64_t count = report.assembly.malformed[reason];
+    if (count != 0)
+      counts.emplace_back(malformedReasonText(static_cast<MalformedReason>(reason)), count);
+  }
+  return counts;
+}
+
 void logReport(const ExtractionReport& report) {
   if (!tesselReporterLog().isEnabled(LogLevel::debug)) return;
-  for (size_t i = 0; i < kMalformedReasons; ++i) {
-    if (report.assembly.malformed[i] == 0) continue;
-    tesselReporterLog().debug("Trace store: %llu entries are no trace points: %@",
-                              report.assembly.malformed[i],
-                              malformedReasonText(static_cast<MalformedReason>(i)));
+  for (const auto& [reason, count] : malformedCounts(report)) {
+    tesselReporterLog().debug("Trace store: %llu entries are no trace points: %@", count, reason);
   }
   logCount(report.assembly.droppedOpenIntervals, "open intervals were dropped, the oldest first");
   logCount(report.beyondPairLimit,

@@ -3,6 +3,9 @@
 #pragma once
 
 #include <cstdint>
+#include <string>
+#include <utility>
+#include <vector>
 
 #include "linux/trace/IntervalAssembler.h"
 #include "linux/trace/StoreReport.h"
@@ -22,6 +25,11 @@ struct ExtractionReport {
     return assembly.malformed[static_cast<size_t>(reason)];
   }
 };
+
+// Reasons in words, and how often each.
+using MalformedCounts = std::vector<std::pair<std::string, uint64_t>>;
+// Why entries are no trace points; the reasons that occurred.
+MalformedCounts malformedCounts(const ExtractionReport& report);
 
 // Says what was not delivered and why, and what was wrong with the store, in one debug line each.
 void logReport(const ExtractionReport& report);

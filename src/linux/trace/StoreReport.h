@@ -17,6 +17,8 @@ struct FileProblem {
   std::string reason;
   uint64_t firstPlace = 0;  // byte offset in the file
   uint64_t count = 0;
+
+  bool operator==(const FileProblem&) const = default;
 };
 
 struct FileReport {
@@ -30,12 +32,15 @@ struct FileReport {
   std::vector<FileProblem> problems;
 
   void addProblem(std::string_view reason, uint64_t place, uint64_t count = 1);
+  bool operator==(const FileReport&) const = default;
 };
 
 // Entries that the journal daemon dropped, by the unit that wrote them.
 struct DroppedEntries {
   std::string unit;  // empty: the daemon named none, or one too many
   uint64_t count = 0;
+
+  bool operator==(const DroppedEntries&) const = default;
 };
 
 struct StoreReport {
@@ -54,6 +59,7 @@ struct StoreReport {
 
   // Whether the store reaches back to the start of the range.
   bool reachesRangeStart() const { return oldestEntry && *oldestEntry <= rangeStart; }
+  bool operator==(const StoreReport&) const = default;
 };
 
 }  // namespace tessel

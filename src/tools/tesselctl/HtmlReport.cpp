@@ -293,7 +293,7 @@ Html readingSection(const ExtractionReport& report, const ReportFacts& facts) {
   };
   row("log events", report.entriesRead);
   row("trace points among them", report.assembly.tracePoints);
-  for (const auto& [reason, count] : malformedReasons(report)) row("malformed: " + reason, count);
+  for (const auto& [reason, count] : malformedCounts(report)) row("malformed: " + reason, count);
   const std::pair<std::string_view, uint64_t> rest[] = {
       {"ends whose begin was not read", report.assembly.unmatchedEnds},
       {"begins replaced by a second one", report.assembly.replacedBegins},

@@ -5,11 +5,13 @@
 #include <CLI/CLI.hpp>
 #include <cerrno>
 #include <memory>
+#include <nlohmann/json.hpp>
 
 #include "linux/Files.h"
 #include "service/CookieFile.h"
 #include "tools/tesselctl/Environment.h"
 #include "tools/tesselctl/JsonLine.h"
+#include "tools/tesselctl/Losses.h"
 #include "tools/tesselctl/ReporterStatus.h"
 #include "tools/tesselctl/ShownText.h"
 #include "tools/tesselctl/Terminal.h"
@@ -44,6 +46,7 @@ void writeRun(std::string& out, const RunRecord& run, bool hasBooks) {
   if (hasBooks)
     object.boolean("objects_balance", run.objectsBalance())
         .boolean("rows_balance", run.rowsBalance());
+  if (run.reading) object.raw("reading", terminalJson(jsonLine(digestJson(*run.reading))));
   object.end();
 }
 
@@ -182,6 +185,7 @@ class Screen {
       if (run.outcome == RunOutcome::bailedOut)
         more("the marker of a run that died stood there; it is removed");
       if (status_.hasBooks()) books(run);
+      if (run.reading) store(*run.reading, run.logEvents);
     }
     if (status_.runWithoutRecord()) {
       more(std::string(status_.run ? "A later run began " : "A run began ") +
@@ -213,6 +217,17 @@ class Screen {
   void balance(std::string_view what, bool balances, const std::string& words) {
     line(what, balances ? "balance" : "DO NOT", balances ? Colour::good : Colour::bad,
          balances ? words : "balance: " + words);
+  }
+
+  void store(const ReadingDigest& reading, uint64_t entries) {
+    std::string words = counted(reading.filesRead, "file", "files") + " and " +
+                        counted(entries, "entry", "entries") + " read";
+    if (reading.filesOutsideRange != 0)
+      words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
+    const std::vector<std::string> losses = wordsForLosses(reading);
+    line("Store", losses.empty() ? "whole" : "not whole",
+         losses.empty() ? Colour::good : Colour::caution, words);
+    for (const std::string& loss : losses) more(loss);
   }
 
   void marker() {

@@ -1,8 +1,11 @@
 // The figures of a dry run as JSON and as tables.
 
 #include <algorithm>
+#include <nlohmann/json.hpp>
 
+#include "linux/ReadingDigest.h"
 #include "tools/tesselctl/JsonLine.h"
+#include "tools/tesselctl/Losses.h"
 #include "tools/tesselctl/ShownText.h"
 #include "tools/tesselctl/Tally.h"
 
@@ -55,22 +58,6 @@ void writeFile(std::string& out, const FileReport& file) {
   object.text("path", std::string_view(file.path)).count("entries_read", file.entriesRead);
   if (file.skipped) object.text("skipped", std::string_view(*file.skipped));
   object.array("problems", file.problems, writeProblem).end();
-}
-
-void writeDropped(std::string& out, const DroppedEntries& dropped) {
-  JsonObject(out).text("unit", std::string_view(dropped.unit)).count("count", dropped.count).end();
-}
-
-// What is known of the store beside its files.
-void writeStore(std::string& out, const StoreReport& store) {
-  JsonObject object(out);
-  if (store.oldestEntry) object.count("oldest", *store.oldestEntry);
-  object.boolean("reaches_start", store.reachesRangeStart())
-      .count("duplicates", store.duplicateEntries)
-      .count("sequence_gaps", store.sequenceGaps)
-      .count("missing", store.missingEntries)
-      .count("files_not_looked_at", store.filesNotLookedAt);
-  object.array("dropped", store.dropped, writeDropped).end();
 }
 
 void writeKinds(std::string& out, const Tally& tally) {
@@ -193,50 +180,31 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
   return out;
 }
 
+void addLosses(Table& table, const std::vector<Loss>& losses) {
+  for (const Loss& loss : losses) table.add({grouped(loss.count), terminalText(loss.what)});
+}
+
 std::string lossLines(const ExtractionReport& report, const Terminal& terminal) {
+  const AssemblyCounts& counts = report.assembly;
   Table table({{"ENTRIES", Table::Align::right}, {"WHY NO TRACE OBJECT CAME OF THEM"}});
-  for (const auto& [reason, count] : malformedReasons(report))
-    table.add({grouped(count), "malformed: " + reason});
-  const std::pair<uint64_t, const char*> others[] = {
-      {report.assembly.unmatchedEnds, "an end whose begin was not read"},
-      {report.assembly.replacedBegins, "a begin that was replaced by a second one"},
-      {report.assembly.openIntervals, "a begin that waits for its end"},
-      {report.assembly.droppedOpenIntervals, "a begin that was one too many to wait"},
-      {report.beyondPairLimit, "of a subsystem and category that were one pair too many"},
-  };
-  for (const auto& [count, reason] : others) {
-    if (count != 0) table.add({grouped(count), reason});
-  }
+  addLosses(table, entryLosses(malformedCounts(report), counts.droppedOpenIntervals,
+                               report.beyondPairLimit));
+  addLosses(table, thoseThatOccurred({
+                       {counts.unmatchedEnds, "an end whose begin was not read"},
+                       {counts.replacedBegins, "a begin that was replaced by a second one"},
+                       {counts.openIntervals, "a begin that waits for its end"},
+                   }));
   return table.empty() ? "" : "\n" + table.render(terminal, 2);
 }
 
 // What the store itself has lost or never had; empty where nothing is missing.
 std::string storeLines(const ExtractionReport& report, const Terminal& terminal) {
-  const StoreReport& store = report.store;
-  std::string out;
-  if (store.oldestEntry && !store.reachesRangeStart()) {
-    const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*store.oldestEntry)}};
-    out = "\nThe store reaches back to " + dateText(oldest) + " only.\n";
-  }
+  const std::string part = partOfPeriod(report.store);
   Table table(
       {{"NUMBER", Table::Align::right}, {"WHAT THE STORE LACKS", Table::Align::left, true}});
-  if (store.missingEntries != 0) {
-    table.add(
-        {grouped(store.missingEntries),
-         "entries, by " + counted(store.sequenceGaps, "gap", "gaps") + " in the sequence numbers"});
-  }
-  for (const DroppedEntries& dropped : store.dropped) {
-    table.add({grouped(dropped.count),
-               "entries that the journal daemon dropped, of " +
-                   (dropped.unit.empty() ? "no unit" : terminalText(dropped.unit))});
-  }
-  if (report.assembly.withoutImagePath != 0) {
-    table.add({grouped(report.assembly.withoutImagePath),
-               "_EXE of trace points, whose process was gone too soon"});
-  }
-  if (store.filesNotLookedAt != 0)
-    table.add({grouped(store.filesNotLookedAt), "files that were too many to look at"});
-  return out + (table.empty() ? "" : "\n" + table.render(terminal, 2));
+  addLosses(table, storeLosses(report.store, report.assembly.withoutImagePath));
+  return (part.empty() ? "" : "\n" + part + ".\n") +
+         (table.empty() ? "" : "\n" + table.render(terminal, 2));
 }
 
 std::string fileLines(const StoreReport& store, const Terminal& terminal) {
@@ -245,7 +213,7 @@ std::string fileLines(const StoreReport& store, const Terminal& terminal) {
                {"FILE", Table::Align::left, true}});
   for (const FileReport& file : store.files) {
     if (file.skipped && !file.outsideRange)
-      table.add({"not read: " + terminalText(*file.skipped), "", terminalText(file.path)});
+      table.add({terminalText(whyNotRead(file)), "", terminalText(file.path)});
     for (const FileProblem& problem : file.problems) {
       table.add({terminalText(problem.reason), grouped(problem.count), terminalText(file.path)});
     }
@@ -254,16 +222,6 @@ std::string fileLines(const StoreReport& store, const Terminal& terminal) {
 }
 
 }  // namespace
-
-std::vector<std::pair<std::string, uint64_t>> malformedReasons(const ExtractionReport& report) {
-  std::vector<std::pair<std::string, uint64_t>> reasons;
-  for (size_t reason = 0; reason < kMalformedReasons; ++reason) {
-    const uint64_t count = report.assembly.malformed[reason];
-    if (count != 0)
-      reasons.emplace_back(malformedReasonText(static_cast<MalformedReason>(reason)), count);
-  }
-  return reasons;
-}
 
 std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
   std::string out;
@@ -278,7 +236,7 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
   object.array("pairs", tally.pairs(), writePair);
   object.nested("malformed", [&](std::string& inner) {
     JsonObject malformed(inner);
-    for (const auto& [reason, count] : malformedReasons(report)) malformed.count(reason, count);
+    for (const auto& [reason, count] : malformedCounts(report)) malformed.count(reason, count);
     malformed.end();
   });
   object.array("whitelist_misses", tally.misses(), writeMiss);
@@ -286,7 +244,7 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
   object.nested("intervals", [&](std::string& inner) { writeIntervals(inner, report.assembly); });
   object.count("beyond_pair_limit", report.beyondPairLimit);
   object.count("without_exe", report.assembly.withoutImagePath);
-  object.nested("store", [&](std::string& inner) { writeStore(inner, report.store); });
+  object.raw("store", terminalJson(jsonLine(storeJson(report.store))));
   object.array("files", report.store.files, writeFile);
   object.number("start", Number{int64_t{tally.period().start.time_since_epoch().count()}});
   object.number("end", Number{int64_t{tally.period().end.time_since_epoch().count()}});

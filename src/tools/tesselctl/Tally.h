@@ -152,7 +152,5 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report);
 // The figures for a human.
 std::string summaryText(const Tally& tally, const ExtractionReport& report,
                         const Terminal& terminal);
-// Why records were malformed, and how often each; those that occurred.
-std::vector<std::pair<std::string, uint64_t>> malformedReasons(const ExtractionReport& report);
 
 }  // namespace tessel::ctl
