@@ -37,6 +37,7 @@ std::vector<Loss> droppedEntries(const StoreReport& store) {
 
 std::vector<std::string> inWords(const std::vector<Loss>& losses) {
   std::vector<std::string> lines;
+  lines.reserve(losses.size());
   for (const Loss& loss : losses) lines.push_back(grouped(loss.count) + " " + loss.what);
   return lines;
 }
