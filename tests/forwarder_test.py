@@ -292,18 +292,13 @@ class Process(ForwarderTest):
         self.add(1)
         with Receiver() as receiver:
             process = subprocess.Popen([FORWARDER], env=self.environment(receiver))
-            deadline = time.monotonic() + 60
-            while len(receiver.requests) < 1 or self.waiting():
-                self.assertLess(time.monotonic(), deadline)
-                time.sleep(0.01)
+            harness.wait_for(lambda: len(receiver.requests) == 1 and not self.waiting())
             for suffix in ("-wal", "", "-shm"):
                 if os.path.exists(self.path + suffix):
                     os.rename(self.path + suffix, self.path + ".damaged-x" + suffix)
             make_spool(self.state)
             self.add(2)
-            while len(receiver.requests) < 2 or self.waiting():
-                self.assertLess(time.monotonic(), deadline)
-                time.sleep(0.01)
+            harness.wait_for(lambda: len(receiver.requests) == 2 and not self.waiting())
             process.terminate()
             self.assertEqual(process.wait(60), 0)
 

@@ -42,10 +42,6 @@ TEST(MountTableTest, TheTopmostMountAtTheRootCounts) {
   EXPECT_EQ(MountTable(directory.path("none")).rootFilesystemTypeName(), std::nullopt);
 }
 
-TEST(MountTableTest, TheKernelsOwnTableIsUnderstood) {
-  EXPECT_TRUE(MountTable().rootFilesystemTypeName().has_value());
-}
-
 TEST(BuildVariantTest, InternalIsWhatTheLastVariantIdSays) {
   const struct {
     const char* release;
