@@ -54,6 +54,8 @@ def each(machine_points, cases, check):
 
 
 class FaultTest(unittest.TestCase):
+    assert_clean = MachineTest.assert_clean
+
     def machine(self, points):
         machine = FaultMachine(points)
         self.addCleanup(machine.close)
@@ -61,8 +63,7 @@ class FaultTest(unittest.TestCase):
 
     def assert_next_run_reports(self, machine):
         before = len(machine.stored())
-        result = machine.run()
-        self.assertEqual(result.status, 0, result.errors)
+        self.assert_clean(machine.run())
         self.assertEqual(machine.stored()[before:], machine.expected)
         self.assertFalse(machine.marker_exists())
 
@@ -72,8 +73,7 @@ class FaultTest(unittest.TestCase):
         self.assertEqual(kept, machine.expected[:len(kept)])
         self.assertEqual(machine.marker_exists(), marker)
         if marker:
-            bailing = machine.run()
-            self.assertEqual(bailing.status, 0, bailing.errors)
+            bailing = self.assert_clean(machine.run())
             self.assertIn(BAILED, bailing.log)
             self.assertEqual(machine.stored(), kept)
         self.assert_next_run_reports(machine)
@@ -82,8 +82,7 @@ class FaultTest(unittest.TestCase):
 class Disk(FaultTest):
     def check_spool(self, machine, case):
         at, error, times = case
-        result = machine.run_faulty(PATH=SPOOL, AT=at, ERRNO=error, TIMES=times)
-        self.assertEqual(result.status, 0, result.errors)
+        result = self.assert_clean(machine.run_faulty(PATH=SPOOL, AT=at, ERRNO=error, TIMES=times))
         self.assertFalse(machine.marker_exists())
         self.assertIn("Cleared cookie file", result.log)
         complaints = [line for line in result.log if line.startswith("Spool ")]
@@ -126,12 +125,10 @@ class Disk(FaultTest):
 
     def test_a_marker_that_cannot_be_made_is_no_run_and_one_that_cannot_be_removed_costs_one_run(self):
         machine = self.machine(some_points(2))
-        result = machine.run_faulty(PATH="tessel_reporter_running", AT=1, ERRNO=errno.ENOSPC, TIMES=1)
-        self.assertEqual(result.status, 0, result.errors)
+        result = self.assert_clean(machine.run_faulty(PATH="tessel_reporter_running", AT=1, ERRNO=errno.ENOSPC, TIMES=1))
         self.assertIn("Could not create cookie file", result.log)
         self.assertEqual(machine.rows(), [])
-        result = machine.run_faulty(PATH="tessel_reporter_running", AT=2, ERRNO=errno.EROFS)
-        self.assertEqual(result.status, 0, result.errors)
+        result = self.assert_clean(machine.run_faulty(PATH="tessel_reporter_running", AT=2, ERRNO=errno.EROFS))
         self.assertTrue(any(line.startswith("Could not clear cookie file") for line in result.log), result.log)
         self.assert_recovers(machine, marker=True)
 
@@ -159,8 +156,7 @@ class Disk(FaultTest):
         process = machine.start()
         wait_for(lambda: len(machine.rows()) > 10)
         shutil.rmtree(machine.state)
-        result = machine.result(process)
-        self.assertEqual(result.status, 0, result.errors)
+        self.assert_clean(machine.result(process))
         self.assertFalse(machine.marker_exists())
         machine.forget_state()
         self.assert_next_run_reports(machine)
@@ -176,8 +172,7 @@ class Clock(FaultTest):
             before = time.monotonic()
             with open(wrong, "w", encoding="ascii") as file:
                 file.write(str(seconds))
-            result = machine.result(process)
-            self.assertEqual(result.status, 0, result.errors)
+            self.assert_clean(machine.result(process))
             self.assertLess(time.monotonic() - before, 30, "pacing must not wait for the wall clock")
             self.assertEqual(machine.stored(), machine.expected)
             record = machine.record()
@@ -217,8 +212,7 @@ class CutJournal(MachineTest):
         process = self.machine.start()
         wait_for(lambda: len(self.machine.rows()) > 10)
         os.truncate(self.path, size)
-        result = self.machine.result(process)
-        self.assert_clean(result)
+        result = self.assert_clean(self.machine.result(process))
         self.assertFalse(self.machine.marker_exists())
         self.assertTrue(any(self.path in line and complaint in line for line in result.log), result.log[-20:])
         return dict(self.machine.rows()[-1][1])["EventsReported"]

@@ -227,6 +227,11 @@ class MachineTest(unittest.TestCase):
 
     def assert_clean(self, result):
         self.assertEqual(result.status, 0, result.errors)
+        return result
+
+    def run_clean(self, **extra):
+        """One run of the service, which ends well."""
+        return self.assert_clean(self.machine.run(**extra))
 
 
 def wait_for(condition, seconds=60):

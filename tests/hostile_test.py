@@ -121,8 +121,7 @@ class Odd(MachineTest):
     def run_odd(self, write, internal):
         self.machine.set_internal(internal)
         write(self.entries())
-        result = self.machine.run()
-        self.assert_clean(result)
+        result = self.run_clean()
         assert_plain(self, result.errors)
         self.assertFalse(any(line.startswith("error: forged") for line in result.errors.splitlines()))
         rows = self.machine.rows()

@@ -27,8 +27,7 @@ class Launch(MachineTest):
         with open(noise, "wb") as file:
             file.write(random.Random(1).randbytes(1 << 20))
         for path in (absent, noise):
-            result = self.machine.run(TESSEL_TRACE_STORE=path)
-            self.assert_clean(result)
+            result = self.run_clean(TESSEL_TRACE_STORE=path)
             failures = [line for line in result.log if line.startswith("Failed to process tessel data due to error: ")]
             self.assertEqual(len(failures), 1, result.log)
             self.assertIn(path, failures[0])
@@ -38,8 +37,7 @@ class Launch(MachineTest):
     def test_a_state_directory_that_cannot_be_written_to_costs_the_events_and_is_said(self):
         self.machine.write_journal(some_points(3))
         self.machine.read_only.append(self.machine.state)
-        result = self.machine.run()
-        self.assert_clean(result)
+        result = self.run_clean()
         for beginning in ("Spool ", "Could not record the run: "):
             said = [line for line in result.log if line.startswith(beginning)]
             self.assertEqual(len(said), 1, result.log)
@@ -57,8 +55,7 @@ class Deferral(MachineTest):
         time.sleep(2.5)
         self.assertIsNone(process.poll())
         os.unlink(wish)
-        result = self.machine.result(process)
-        self.assert_clean(result)
+        result = self.assert_clean(self.machine.result(process))
         self.assertEqual(result.log[:2], ["Checking in", "Deferred tessel_reporter"])
         self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
 
@@ -67,8 +64,7 @@ class Deferral(MachineTest):
         process = self.machine.start()
         wait_for(lambda: self.machine.rows())
         open(os.path.join(self.machine.state, "defer"), "w", encoding="utf-8").close()
-        result = self.machine.result(process)
-        self.assert_clean(result)
+        result = self.assert_clean(self.machine.result(process))
         statistics = dict(self.machine.rows()[-1][1])
         self.assertTrue(statistics["WasInterrupted"])
         self.assertLess(statistics["EventsReported"], 3000)
@@ -100,8 +96,7 @@ class TwoRuns(MachineTest):
         process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1")
         wait_for(lambda: [name for name, _ in self.machine.rows()].count(STATISTICS) >= 2)
         interrupt(process)
-        result = self.machine.result(process)
-        self.assert_clean(result)
+        result = self.assert_clean(self.machine.result(process))
         books = [dict(payload) for name, payload in self.machine.rows() if name == STATISTICS]
         self.assertEqual([book["EventsReported"] for book in books[:2]], [10, 11], "the 503rd object is in the second")
         throttled = [int(line.split()[1]) for line in result.log if line.startswith("Throttled ")]

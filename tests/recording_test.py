@@ -53,7 +53,7 @@ def record_one_of_each(*where):
 class Store(MachineTest):
     def test_an_export_file_is_delivered_as_recorded(self):
         expected = record_one_of_each("--store", self.machine.store)
-        self.assert_clean(self.machine.run())
+        self.run_clean()
         self.assertEqual(sent(self.machine), expected)
 
     def test_the_journals_own_tools_take_the_file(self):
@@ -64,7 +64,7 @@ class Store(MachineTest):
             self.skipTest(harness.REMOTE + " is not installed")
         subprocess.run([harness.REMOTE, "-o", journal, export], check=True, capture_output=True)
         os.unlink(export)
-        self.assert_clean(self.machine.run())
+        self.run_clean()
         self.assertEqual(sent(self.machine), expected)
 
     def test_what_it_was_told_stands_in_place_of_what_is_true(self):
@@ -73,7 +73,7 @@ class Store(MachineTest):
         self.assertEqual(ctl("record", "begin", *point, *common, "--ago", "100").returncode, 0)
         self.assertEqual(ctl("record", "end", *point, *common, "--ago", "40", "--comm", "other").returncode, 0)
         self.assertEqual(ctl("record", "event", *point, *common, "--ago", "90000").returncode, 0)
-        self.assert_clean(self.machine.run())
+        self.run_clean()
         payloads = [dict(payload) for name, payload in self.machine.rows() if name == EVENT]
         self.assertEqual(len(payloads), 1)
         self.assertAlmostEqual(payloads[0]["DurationInSeconds"], 60, delta=10)
@@ -128,15 +128,14 @@ class InsideDaemon(MachineTest):
         fields = ("MESSAGE=tessel\nTESSEL_KIND=event\nTESSEL_SUBSYSTEM=com.vantor.Calendar\nTESSEL_CATEGORY=View\n"
                   "TESSEL_NAME=Logged\nTESSEL_TELEMETRY=1\n")
         subprocess.run(["logger", "--journald"], input=fields, text=True, check=True)
-        self.assert_clean(self.machine.run(TESSEL_TRACE_STORE=None))
+        self.run_clean(TESSEL_TRACE_STORE=None)
         self.assertEqual(sent(self.machine), expected + [("Event", "Logged")])
         self.log_to_the_journal(len(expected) + 1)
 
     def log_to_the_journal(self, delivered):
         """A service that logs to the journal that it reads meets its own lines there: none is a trace point."""
         for run in (1, 2):
-            result = self.machine.run(TESSEL_TRACE_STORE=None, TESSEL_LOG="journal")
-            self.assert_clean(result)
+            result = self.run_clean(TESSEL_TRACE_STORE=None, TESSEL_LOG="journal")
             self.assertEqual(result.errors, "")
             self.assertEqual(len(sent(self.machine)), delivered * (run + 1))
         subprocess.run(["journalctl", "--sync"], check=True)

@@ -67,8 +67,7 @@ class MixedDay(MachineTest):
 
     def test_spool_and_log_are_what_the_recorded_points_must_yield(self):
         self.machine.write_journal(self.entries)
-        result = self.machine.run()
-        self.assert_clean(result)
+        result = self.run_clean()
         expected = self.expected()
         self.assert_rows(expected)
         self.assertFalse(self.machine.marker_exists())
@@ -87,15 +86,13 @@ class MixedDay(MachineTest):
         self.machine.set_internal(True)
         self.machine.task('{"TaskedOn": false}')
         self.machine.write_journal(self.entries)
-        result = self.machine.run()
-        self.assert_clean(result)
+        result = self.run_clean()
         self.assert_rows(self.expected(internal=True))
         self.assertIn("Reporting based on os_flavor result", result.log)
 
     def test_the_log_level_changes_nothing_that_is_sent(self):
         self.machine.write_export(self.entries)
-        result = self.machine.run(TESSEL_LOG_LEVEL="error")
-        self.assert_clean(result)
+        result = self.run_clean(TESSEL_LOG_LEVEL="error")
         self.assertEqual(result.log, [])
         self.assert_rows(self.expected())
 
@@ -105,8 +102,7 @@ class NotTasked(MachineTest):
         self.machine = harness.Machine()
         self.addCleanup(self.machine.close)
         self.machine.write_export([harness.point("event", "com.vantor.Calendar", "View", "Open")])
-        result = self.machine.run()
-        self.assert_clean(result)
+        result = self.run_clean()
         self.assertEqual(result.log, ["Checking in",
                                       "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"])
         self.assertEqual(self.machine.rows(), [])

@@ -27,7 +27,9 @@ TEST(WorkerQueueTest, RunsOneAtATimeInOrderOfSubmissionWhicheverThreadSubmits) {
     });
   }
   for (std::thread& thread : threads) thread.join();
-  queue.sync([&count] { EXPECT_EQ(count, kThreads * kEach); });
+  int countInSync = 0;
+  queue.sync([&] { countInSync = count; });
+  EXPECT_EQ(countInSync, kThreads * kEach);
   for (const auto& order : orders) EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
 }
 
