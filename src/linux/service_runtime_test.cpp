@@ -83,6 +83,21 @@ class ProcessEndTest : public ServiceRuntimeTest {
   ProcessEndTest() { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
 
+TEST_F(ProcessEndTest, TheMainLoopEndsTheProcessWhenTheLastTransactionCloses) {
+  EXPECT_EXIT(
+      {
+        WorkerQueue queue("test");
+        auto transaction = std::make_shared<std::unique_ptr<KeepAliveTransaction>>(
+            runtime_.openTransaction("work"));
+        queue.async([this, transaction] {
+          runtime_.requestCleanExit();
+          transaction->reset();
+        });
+        runtime_.runMainLoop();
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
 TEST_F(ProcessEndTest, AnInterruptBeforeTheSourceIsResumedIsDeliveredOnceItIs) {
   EXPECT_EXIT(
       {

@@ -54,6 +54,14 @@ TEST(PayloadTest, TextIsEscapedAndInvalidUtf8Replaced) {
     appendJsonString(out, c.text);
     EXPECT_EQ(out, c.json);
   }
+  // Just outside of what three and four bytes may say, and just inside.
+  for (const std::string_view bad : {"\xe0\x9f\xbf", "\xf0\x8f\xbf\xbf", "\xf4\x90\x80\x80"}) {
+    std::string replaced;
+    for (size_t i = 0; i < bad.size(); ++i) replaced += "\xef\xbf\xbd";
+    EXPECT_EQ(replaceInvalidUtf8(bad), replaced);
+  }
+  const std::string good = "\xe0\xa0\x80|\xf0\x90\x80\x80|\xf4\x8f\xbf\xbf";
+  EXPECT_EQ(replaceInvalidUtf8(good), good);
   EXPECT_EQ(replaceInvalidUtf8("\xff|\"gr\xc3\xbc\xc3"), "\xef\xbf\xbd|\"gr\xc3\xbc\xef\xbf\xbd");
 }
 
