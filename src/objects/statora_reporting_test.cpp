@@ -69,6 +69,7 @@ TEST_F(StatoraReportingTest, AbsentValuesAreLeftOutOrUnknown) {
             R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
             R"("String1Name":"period","Number1Name":"count",)"
             R"("IntervalType":"TesselObject","DurationInSeconds":0})");
+  EXPECT_EQ(json(TesselSupportObject()), "none");
 }
 
 TEST_F(StatoraReportingTest, BeginAndEndOfAnIntervalAreNamedEachByItself) {
