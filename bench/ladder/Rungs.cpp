@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "linux/trace/JournalExtractor.h"
+#include "linux/trace/TracePointTable.h"
 #include "linux/trace/TraceStore.h"
 
 namespace tessel::bench {
@@ -18,6 +19,7 @@ namespace {
 // Wants what a trace point needs and looks at it no further.
 class Glance final : public FieldTokenizer {
  public:
+  std::vector<EntryMark> marks() const override { return TracePointTable().marks(); }
   bool wants(std::string_view name) const override {
     return name.starts_with("TESSEL_") || name == "_EXE" || name == "_COMM" || name == "_PID";
   }

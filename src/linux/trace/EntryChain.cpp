@@ -7,10 +7,9 @@ namespace tessel {
 
 using namespace journal_format;
 
-EntryChain::EntryChain(JournalFile& file)
-    : file_(file), itemSize_(file.header().compact() ? 4 : 8) {
-  const uint64_t first = file.header().entryArray;
-  if (!enterArray(first) && file.header().entryCount != 0) damagedAt(first);
+EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count)
+    : file_(file), itemSize_(file.header().compact() ? 4 : 8), count_(count) {
+  if (!enterArray(first) && count_ != 0) damagedAt(first);
 }
 
 uint64_t EntryChain::firstOfNextPiece() {
@@ -40,7 +39,7 @@ void EntryChain::finishArray() {
   const uint64_t last = array_;
   if (next == 0) {
     array_ = 0;
-    if (listed_ < file_.header().entryCount) damagedAt(last);
+    if (listed_ < count_) damagedAt(last);
   } else if (!enterArray(next)) {
     damagedAt(last);
   }
@@ -49,8 +48,8 @@ void EntryChain::finishArray() {
 // Reads the next piece, perhaps an empty one; false where the chain has ended.
 bool EntryChain::loadPiece() {
   if (array_ == 0) return false;
-  const JournalHeader& header = file_.header();
-  if (header.beingWritten() && listed_ >= header.entryCount) {
+  const bool growing = file_.header().beingWritten();
+  if (growing && listed_ >= count_) {
     array_ = 0;
     return false;
   }
@@ -60,7 +59,7 @@ bool EntryChain::loadPiece() {
   }
   uint64_t count = std::min<uint64_t>(arraySize_ - arrayIndex_, kPieceBytes / itemSize_);
   // Items are linked in order, so what stands beyond the count was not linked when we looked.
-  if (header.beingWritten()) count = std::min(count, header.entryCount - listed_);
+  if (growing) count = std::min(count, count_ - listed_);
   if (!takePiece(static_cast<size_t>(count)))
     damagedAt(array_ + kArrayItemsAt + arrayIndex_ * itemSize_);
   arrayIndex_ += count;
@@ -79,7 +78,7 @@ bool EntryChain::takePiece(size_t count) {
     const uint64_t offset = itemAt(i);
     if (offset <= previous || !file_.mayHoldObject(offset, kEntryItemsAt)) {
       // Behind the last entry an array is filled with zeros, or with what was linked meanwhile.
-      if (listed_ + i < file_.header().entryCount) return false;
+      if (listed_ + i < count_) return false;
       pieceSize_ = i;
       array_ = 0;
       return true;

@@ -1,4 +1,5 @@
-// EntryChain: the offsets of a journal file's entries as its chain of entry arrays lists them.
+// EntryChain: the offsets of entries as a chain of entry arrays of a journal file lists them: all
+// entries of the file, or those that refer to one data object.
 //
 // The chain is read in small pieces. A piece whose offsets are not all possible and strictly
 // increasing is not used at all, and a broken link ends the chain: in both cases the caller is told
@@ -18,8 +19,9 @@ namespace tessel {
 
 class EntryChain {
  public:
-  // `file` must outlive the chain.
-  explicit EntryChain(JournalFile& file);
+  // The chain that begins with the array at `first` and lists `count` entries. `file` must outlive
+  // the chain.
+  EntryChain(JournalFile& file, uint64_t first, uint64_t count);
 
   // The offset of the next entry, greater than all before; 0 where the chain ends.
   uint64_t next() {
@@ -34,7 +36,7 @@ class EntryChain {
   uint64_t problemAt() const { return problemAt_; }
 
  private:
-  static constexpr size_t kPieceBytes = 1024;
+  static constexpr size_t kPieceBytes = 512;
 
   uint64_t firstOfNextPiece();
   bool loadPiece();
@@ -53,6 +55,7 @@ class EntryChain {
 
   JournalFile& file_;
   const size_t itemSize_;
+  const uint64_t count_;
   std::array<uint8_t, kPieceBytes> piece_;
   size_t pieceSize_ = 0;  // in items
   size_t pieceNext_ = 0;

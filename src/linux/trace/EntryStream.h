@@ -15,6 +15,7 @@
 #include <cstring>
 #include <span>
 #include <string_view>
+#include <vector>
 
 namespace tessel {
 
@@ -38,10 +39,21 @@ inline constexpr size_t kMaxFieldNameLength = 64;
 inline constexpr size_t kMaxFieldValueLength = 4096;
 inline constexpr size_t kMaxFieldHead = kMaxFieldNameLength + 1 + kMaxFieldValueLength + 1;
 
+// A field that makes an entry worth showing. Companions are fields that make it so as well, and
+// that nearly always stand in the same entries.
+struct EntryMark {
+  std::string_view field;
+  std::string_view value = {};  // the one that counts; empty: any does
+  std::vector<std::string_view> companions = {};
+};
+
 // Turns distinct FIELD=value texts into tokens.
 class FieldTokenizer {
  public:
   virtual ~FieldTokenizer() = default;
+  // What makes an entry worth showing; where there is nothing, every entry is. A reader that knows
+  // which entries carry a mark may deliver the others without tokens.
+  virtual std::vector<EntryMark> marks() const { return {}; }
   // Whether a field of this name can ever have a token; asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
   // The token of one FIELD=value; kNoToken for a field that is not wanted. `value` is the value's

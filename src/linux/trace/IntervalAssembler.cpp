@@ -12,14 +12,6 @@ FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }
 
-// Whether an entry has no field of a trace point but what the daemon adds to every entry.
-bool isPlainLogEvent(std::span<const FieldToken> tokens) {
-  return std::all_of(tokens.begin(), tokens.end(), [](FieldToken token) {
-    const FieldKind kind = TracePointTable::kind(token);
-    return kind >= FieldKind::imagePath && kind <= FieldKind::process;
-  });
-}
-
 }  // namespace
 
 IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
@@ -38,7 +30,7 @@ AssemblyCounts IntervalAssembler::counts() const {
 }
 
 void IntervalAssembler::consume(const Entry& entry) {
-  if (isPlainLogEvent(entry.tokens)) return;
+  if (!meansToBeATracePoint(entry.tokens)) return;
   read(entry.tokens);
   if (const auto reason = fault()) {
     ++counts_.malformed[static_cast<size_t>(*reason)];
@@ -54,6 +46,14 @@ void IntervalAssembler::consume(const Entry& entry) {
     case PointKind::end:
       return end(entry.header);
   }
+}
+
+// Whether an entry has one of the fields that a trace point must have, good or not.
+bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens) const {
+  return std::any_of(tokens.begin(), tokens.end(), [this](FieldToken token) {
+    const FieldKind kind = TracePointTable::kind(token);
+    return isRequired(kind) || (kind == FieldKind::malformed && table_.malformedIsRequired(token));
+  });
 }
 
 void IntervalAssembler::read(std::span<const FieldToken> tokens) {

@@ -67,6 +67,7 @@ class IntervalAssembler final : private TokenHolder {
   };
 
   void renewTokens(TracePointTable& table) override;
+  bool meansToBeATracePoint(std::span<const FieldToken> tokens) const;
   void read(std::span<const FieldToken> tokens);
   std::optional<MalformedReason> fault() const;
   void emitEvent();

@@ -19,7 +19,9 @@ JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const Journal
     : file_(std::move(fd), size, header, context.resources.windows),
       number_(number),
       context_(context),
-      chain_(file_),
+      chain_(file_, header.entryArray, header.entryCount),
+      marked_(
+          MarkedEntries::of(file_, context.marks, context.resources.entryListsLeft, context.stop)),
       searchedTo_(header.headerSize),
       firstFresh_(header.headerSize) {
   entry_.sequenceId = header.sequenceId;
@@ -75,12 +77,22 @@ bool JournalEntryStream::take(uint64_t offset) {
   firstFresh_ = searchedTo_;
   searchedTo_ = alignUp(offset + size);
   ++delivered_;
+  entryMarked_ = marked_ == nullptr || isMarked(offset);
+  return true;
+}
+
+bool JournalEntryStream::isMarked(uint64_t offset) {
+  if (!marked_->has(offset)) [[likely]]
+    return false;
+  if (marked_->missed()) context_.report.addProblem("list of entries damaged", offset);
+  if (!marked_->usable()) marked_.reset();
   return true;
 }
 
 // Searches what lies before `listed`, the next entry of the chain; 0: the chain has ended.
 void JournalEntryStream::searchUpTo(uint64_t listed) {
   if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
+  marked_.reset();  // what is found may stand in no list
   pending_ = listed;
   const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
   search_.emplace(file_, std::min(searchedTo_, end), end, context_.stop);
@@ -104,6 +116,7 @@ void JournalEntryStream::finish() {
 }
 
 Entry JournalEntryStream::entry() {
+  if (!entryMarked_) return {entry_, {}};
   context_.tokenizer.beginEntry();
   const size_t count = collectTokens();
   return {entry_, std::span(context_.resources.tokens).first(count)};

@@ -10,6 +10,7 @@
 #pragma once
 
 #include <array>
+#include <memory>
 #include <optional>
 
 #include "linux/trace/Decompressor.h"
@@ -17,6 +18,7 @@
 #include "linux/trace/EntrySearch.h"
 #include "linux/trace/EntryStream.h"
 #include "linux/trace/JournalFile.h"
+#include "linux/trace/MarkedEntries.h"
 #include "linux/trace/StoreReport.h"
 #include "linux/trace/TokenCache.h"
 
@@ -30,6 +32,7 @@ struct JournalReadResources {
   std::array<uint8_t, JournalFile::kMaxDataRead> data;
   std::array<uint8_t, kMaxFieldHead> text;
   std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the entry that is looked at
+  size_t entryListsLeft = MarkedEntries::kMaxListsOfStore;
 };
 
 class JournalEntryStream final : public EntryStream {
@@ -38,6 +41,7 @@ class JournalEntryStream final : public EntryStream {
   struct Context {
     JournalReadResources& resources;
     FieldTokenizer& tokenizer;
+    std::span<const EntryMark> marks;  // of the tokenizer
     const StopFlag& stop;
     FileReport& report;
   };
@@ -55,6 +59,7 @@ class JournalEntryStream final : public EntryStream {
   uint64_t nextListed();
   uint64_t nextFound();
   bool take(uint64_t offset);
+  bool isMarked(uint64_t offset);
   void searchUpTo(uint64_t listed);
   void endSearch();
   void finish();
@@ -69,6 +74,7 @@ class JournalEntryStream final : public EntryStream {
   const uint32_t number_;
   Context context_;
   EntryChain chain_;
+  std::unique_ptr<MarkedEntries> marked_;  // null: every entry may carry a mark
   std::optional<EntrySearch> search_;
   uint64_t pending_ = 0;   // what the chain lists behind the stretch being searched; 0: nothing
   bool finished_ = false;  // the chain has ended
@@ -79,6 +85,7 @@ class JournalEntryStream final : public EntryStream {
   EntryHeader entry_;
   uint64_t entryOffset_ = 0;
   uint64_t entrySize_ = 0;
+  bool entryMarked_ = true;
 };
 
 }  // namespace tessel

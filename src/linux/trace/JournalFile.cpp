@@ -73,12 +73,17 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
   header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
+  if (bytes.size() >= kHeaderRead && header.headerSize >= kHeaderRead) {
+    header.fieldTable = load<uint64_t>(at + kFieldTableAt);
+    header.fieldTableSize = load<uint64_t>(at + kFieldTableSizeAt);
+    header.fieldCount = load<uint64_t>(at + kFieldCountAt);
+  }
   return header;
 }
 
 // The size is asked for last, so that it covers all that the header counts.
 std::variant<JournalBeginning, std::string> readJournalHeader(int fd) {
-  std::array<uint8_t, kMinHeaderSize> bytes;
+  std::array<uint8_t, kHeaderRead> bytes;
   const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
   struct stat status {};
   if (got < 0 || ::fstat(fd, &status) != 0) return std::generic_category().message(errno);

@@ -32,6 +32,9 @@ struct JournalHeader {
   uint64_t lastObject = 0;  // offset of the last object that counts; UINT64_MAX: all that are there
   uint64_t headRealtime = 0;  // of the first and last entry written; 0: unknown
   uint64_t tailRealtime = 0;
+  uint64_t fieldTable = 0;      // offset of the buckets of the hash table of fields; 0: unknown
+  uint64_t fieldTableSize = 0;  // bytes
+  uint64_t fieldCount = 0;      // of distinct names
 
   bool compact() const { return (incompatibleFlags & journal_format::kCompact) != 0; }
   uint32_t unknownFlags() const {
@@ -96,6 +99,8 @@ class JournalFile {
     return static_cast<size_t>((size - journal_format::kEntryItemsAt) >> itemShift_);
   }
   size_t itemSize() const { return size_t{1} << itemShift_; }
+  // Bytes of a data object before its payload.
+  size_t dataHeaderSize() const { return dataHeaderSize_; }
   // Bytes of a data object that are read at most, payload included.
   static constexpr size_t kMaxDataRead = journal_format::kCompactDataHeaderSize + kMaxFieldHead;
 

@@ -19,6 +19,8 @@ inline constexpr char kSignature[9] = "LPKSHHRH";
 
 // The shortest header that is understood; what newer writers append is optional.
 inline constexpr uint64_t kMinHeaderSize = 208;
+// What is read of a longer one.
+inline constexpr uint64_t kHeaderRead = 224;
 // A header that claims more than this is damaged.
 inline constexpr uint64_t kMaxHeaderSize = 4096;
 
@@ -40,11 +42,14 @@ inline constexpr size_t kStateAt = 16;
 inline constexpr size_t kSequenceIdAt = 72;
 inline constexpr size_t kHeaderSizeAt = 88;
 inline constexpr size_t kArenaSizeAt = 96;
+inline constexpr size_t kFieldTableAt = 120;
+inline constexpr size_t kFieldTableSizeAt = 128;
 inline constexpr size_t kTailObjectAt = 136;
 inline constexpr size_t kEntryCountAt = 152;
 inline constexpr size_t kEntryArrayAt = 176;
 inline constexpr size_t kHeadRealtimeAt = 184;
 inline constexpr size_t kTailRealtimeAt = 192;
+inline constexpr size_t kFieldCountAt = 216;
 
 enum ObjectType : uint8_t {
   kUnused = 0,
@@ -63,10 +68,18 @@ inline constexpr uint8_t kKnownDataFlags = kXz | kLz4 | kZstd;
 inline constexpr size_t kObjectHeaderSize = 16;
 inline constexpr size_t kObjectSizeAt = 8;
 
+// A hash table is a row of buckets; objects in one bucket are linked.
+inline constexpr size_t kBucketSize = 16;
+inline constexpr size_t kNextInBucketAt = 24;
+
+inline constexpr size_t kNextValueAt = 32;  // of the same field
+inline constexpr size_t kDataFirstEntryAt = 40;
+inline constexpr size_t kDataEntryArrayAt = 48;  // lists the entries but for the first
 inline constexpr size_t kDataEntryCountAt = 56;
 inline constexpr size_t kDataHeaderSize = 64;
 inline constexpr size_t kCompactDataHeaderSize = 72;
 
+inline constexpr size_t kFieldFirstValueAt = 32;  // the one that was added last
 inline constexpr size_t kFieldHeaderSize = 40;
 inline constexpr size_t kTagSize = 64;
 

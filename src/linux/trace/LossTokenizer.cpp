@@ -31,6 +31,12 @@ FieldToken countToken(std::string_view value) {
 
 }  // namespace
 
+std::vector<EntryMark> LossTokenizer::marks() const {
+  std::vector<EntryMark> marks = user_.marks();
+  if (!marks.empty()) marks.push_back({kMessageId, kLossMessage});
+  return marks;
+}
+
 bool LossTokenizer::wants(std::string_view fieldName) const {
   return user_.wants(fieldName) || fieldName == kMessageId || fieldName == kCount ||
          fieldName == kUnit;

@@ -24,6 +24,7 @@ class LossTokenizer final : public FieldTokenizer {
   // `user` must outlive this.
   explicit LossTokenizer(FieldTokenizer& user) : user_(user) {}
 
+  std::vector<EntryMark> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return user_.generation(); }

@@ -56,6 +56,9 @@ enum class MalformedReason : uint8_t {
 };
 inline constexpr size_t kMalformedReasons = 10;
 
+// Whether every trace point has a field of this kind.
+constexpr bool isRequired(FieldKind kind) { return kind <= FieldKind::category; }
+
 // In words, such as "unknown TESSEL_KIND".
 std::string_view malformedReasonText(MalformedReason reason);
 

@@ -45,8 +45,13 @@ TracePointTable::Field TracePointTable::wholeField(FieldKind kind, uint64_t valu
   return field;
 }
 
-TracePointTable::Field TracePointTable::malformedField(MalformedReason reason) {
-  return wholeField(FieldKind::malformed, static_cast<uint64_t>(reason));
+TracePointTable::Field TracePointTable::malformedField(FieldKind kind, MalformedReason reason) {
+  const uint64_t required = isRequired(kind) ? kMalformedRequired : 0;
+  return wholeField(FieldKind::malformed, static_cast<uint64_t>(reason) | required);
+}
+
+std::vector<EntryMark> TracePointTable::marks() const {
+  return {{"TESSEL_KIND", {}, {"TESSEL_SUBSYSTEM", "TESSEL_CATEGORY"}}};
 }
 
 bool TracePointTable::wants(std::string_view fieldName) const {
@@ -58,7 +63,8 @@ FieldToken TracePointTable::tokenFor(std::string_view field, std::string_view va
   const std::optional<FieldKind> kind = fieldKindOf(field);
   if (!kind) return kNoToken;
   if (size > kMaxFieldValueLength) {
-    return isDaemonField(*kind) ? kNoToken : addOnce(malformedField(MalformedReason::valueTooLong));
+    return isDaemonField(*kind) ? kNoToken
+                                : addOnce(malformedField(*kind, MalformedReason::valueTooLong));
   }
   return parse(*kind, value);
 }
@@ -69,11 +75,11 @@ FieldToken TracePointTable::parse(FieldKind kind, std::string_view value) {
       if (value == "event") return addOnce(wholeField(kind, uint64_t(PointKind::event)));
       if (value == "begin") return addOnce(wholeField(kind, uint64_t(PointKind::begin)));
       if (value == "end") return addOnce(wholeField(kind, uint64_t(PointKind::end)));
-      return addOnce(malformedField(MalformedReason::unknownKind));
+      return addOnce(malformedField(kind, MalformedReason::unknownKind));
     case FieldKind::scope:
       if (value == "process" || value == "system")
         return addOnce(wholeField(kind, value == "system"));
-      return addOnce(malformedField(MalformedReason::unknownScope));
+      return addOnce(malformedField(kind, MalformedReason::unknownScope));
     case FieldKind::telemetry:
       return addOnce(wholeField(kind, value == "1"));
     case FieldKind::attribute:
@@ -94,9 +100,9 @@ FieldToken TracePointTable::parseNumber(FieldKind kind, std::string_view value) 
   if (kind == FieldKind::duration || kind == FieldKind::frameRate) {
     const std::optional<float> real = parseFloat(value);
     if (!real) {
-      return addOnce(malformedField(kind == FieldKind::duration
-                                        ? MalformedReason::invalidDuration
-                                        : MalformedReason::invalidFrameRate));
+      return addOnce(malformedField(kind, kind == FieldKind::duration
+                                              ? MalformedReason::invalidDuration
+                                              : MalformedReason::invalidFrameRate));
     }
     field.form = Form::real;
     field.real = *real;
@@ -119,7 +125,7 @@ FieldToken TracePointTable::parseNumber(FieldKind kind, std::string_view value) 
 FieldToken TracePointTable::parseAttribute(std::string_view value) {
   const size_t equals = value.find('=');
   if (equals == 0 || equals == std::string_view::npos) {
-    return addOnce(malformedField(MalformedReason::invalidAttribute));
+    return addOnce(malformedField(FieldKind::attribute, MalformedReason::invalidAttribute));
   }
   return addAttribute(value.substr(0, equals), value.substr(equals + 1));
 }
@@ -200,7 +206,7 @@ PointKind TracePointTable::pointKind(FieldToken token) const {
 }
 
 MalformedReason TracePointTable::malformedReason(FieldToken token) const {
-  return static_cast<MalformedReason>(at(token).whole);
+  return static_cast<MalformedReason>(at(token).whole & ~kMalformedRequired);
 }
 
 // Whether the table holds more than its limits divided by `share`.

@@ -44,6 +44,7 @@ class TracePointTable final : public FieldTokenizer {
   // REQUIRES: `holder`, where not null, outlives the last call of beginEntry().
   void setHolder(TokenHolder* holder) { holder_ = holder; }
 
+  std::vector<EntryMark> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return generation_; }
@@ -62,6 +63,10 @@ class TracePointTable final : public FieldTokenizer {
   PointKind pointKind(FieldToken token) const;
   bool flag(FieldToken token) const { return token != kNoToken && at(token).whole != 0; }
   MalformedReason malformedReason(FieldToken token) const;
+  // Whether what is malformed is a field that every trace point has.
+  bool malformedIsRequired(FieldToken token) const {
+    return (at(token).whole & kMalformedRequired) != 0;
+  }
   // REQUIRES: the token is one of an attribute.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {
     return contents_.attributes[at(token).whole];
@@ -98,6 +103,8 @@ class TracePointTable final : public FieldTokenizer {
     size_t indexed = 0;
   };
 
+  // Beside the reason in the value of what is malformed.
+  static constexpr uint64_t kMalformedRequired = 0x100;
   // Below the kind in a token. The kinds leave the tokens of the store itself free.
   static constexpr int kIndexBits = 24;
   static_assert(FieldToken(FieldKind::boot) < kFirstReservedToken >> kIndexBits);
@@ -105,7 +112,7 @@ class TracePointTable final : public FieldTokenizer {
   static size_t indexOf(FieldToken token) { return token & ((1u << kIndexBits) - 1); }
   const Field& at(FieldToken token) const { return contents_.fields[indexOf(token)]; }
   static Field wholeField(FieldKind kind, uint64_t value);
-  static Field malformedField(MalformedReason reason);
+  static Field malformedField(FieldKind kind, MalformedReason reason);
   static Contents emptyContents(const TracePointTableLimits& limits);
   FieldToken parse(FieldKind kind, std::string_view value);
   FieldToken parseNumber(FieldKind kind, std::string_view value);

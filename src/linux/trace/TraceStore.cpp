@@ -96,6 +96,7 @@ struct TraceStore::State final : EntryStream {
   JournalReadResources resources;
   ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
+  const std::vector<EntryMark> marks = tokenizer.marks();
   StoreReport facts;  // its files are complete before the first stream is made
   size_t usableFiles = 0;
   size_t foreignFiles = 0;  // that journalctl reads for us
@@ -167,7 +168,7 @@ void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
   }
   merger.add(std::make_unique<JournalEntryStream>(
                  std::move(file.fd), size, header, number,
-                 JournalEntryStream::Context{resources, tokenizer, stop, report}),
+                 JournalEntryStream::Context{resources, tokenizer, marks, stop, report}),
              number, header.sequenceId);
 }
 

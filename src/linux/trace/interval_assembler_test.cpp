@@ -227,8 +227,8 @@ TEST_F(IntervalAssemblerTest, malformedEntriesAreCountedByReason) {
   } cases[] = {
       {{"MESSAGE=hello", "_PID=1", "_EXE=/bin/x"}, std::nullopt},
       {{"TESSEL_SUBSYSTEM=s", "TESSEL_CATEGORY=c"}, MalformedReason::missingKind},
-      {{"TESSEL_NAME=n"}, MalformedReason::missingKind},
-      {{"TESSEL_ATTRIBUTE=a=b"}, MalformedReason::missingKind},
+      {{"TESSEL_CATEGORY=" + atCap + "x"}, MalformedReason::valueTooLong},
+      {{"TESSEL_NAME=" + atCap + "x", "TESSEL_ATTRIBUTE=a=b"}, std::nullopt},
       {{"TESSEL_KIND=event", "TESSEL_CATEGORY=c"}, MalformedReason::missingSubsystem},
       {{"TESSEL_KIND=event", "TESSEL_SUBSYSTEM=s"}, MalformedReason::missingCategory},
       {{"TESSEL_KIND=Event", "TESSEL_SUBSYSTEM=s"}, MalformedReason::unknownKind},

@@ -41,6 +41,8 @@ std::string compressZstd(const std::string& text) {
   return out;
 }
 
+constexpr uint64_t kBuckets = 8;
+
 uint64_t hashOf(const std::string& text) {
   uint64_t hash = 14695981039346656037u;
   for (const char c : text) hash = (hash ^ static_cast<uint8_t>(c)) * 1099511628211u;
@@ -63,11 +65,12 @@ JournalWriter::JournalWriter(JournalLayout layout) : layout_(layout) {
     std::copy(layout_.sequenceId.begin(), layout_.sequenceId.end(),
               file_.begin() + static_cast<ptrdiff_t>(at));
   put<uint64_t>(kHeaderSizeAt, layout_.headerSize);
-  // Both hash tables are there, and empty: what reads in order does not look at them.
+  all_.firstAt = kEntryArrayAt;
+  // The table of data is there, and empty: nobody looks at it.
   for (const auto& [type, at] : {std::pair(kDataHashTable, 104), std::pair(kFieldHashTable, 120)}) {
-    const uint64_t table = beginObject(type, 0, kObjectHeaderSize + 16 * 8);
+    const uint64_t table = beginObject(type, 0, kObjectHeaderSize + kBuckets * kBucketSize);
     put<uint64_t>(static_cast<uint64_t>(at), table + kObjectHeaderSize);
-    put<uint64_t>(static_cast<uint64_t>(at) + 8, 16 * 8);
+    put<uint64_t>(static_cast<uint64_t>(at) + 8, kBuckets * kBucketSize);
   }
 }
 
@@ -96,38 +99,52 @@ uint64_t JournalWriter::beginObject(uint8_t type, uint8_t flags, uint64_t size) 
   return offset;
 }
 
-uint64_t JournalWriter::dataFor(const std::string& field) {
-  const auto known = data_.find(field);
-  if (known != data_.end()) {
-    put<uint64_t>(known->second + kDataEntryCountAt,
-                  load<uint64_t>(reinterpret_cast<const uint8_t*>(file_.data()) + known->second +
-                                 kDataEntryCountAt) +
-                      1);
-    return known->second;
-  }
+uint64_t JournalWriter::wordAt(uint64_t at) const {
+  return load<uint64_t>(reinterpret_cast<const uint8_t*>(file_.data()) + at);
+}
+
+JournalWriter::Data& JournalWriter::dataFor(const std::string& field) {
+  const auto [known, isNew] = data_.try_emplace(field);
+  Data& data = known->second;
+  if (!isNew) return data;
   const bool compressed = layout_.compression != 0 && field.size() >= layout_.compressFrom;
   const std::string payload = !compressed                   ? field
                               : layout_.compression == kXz  ? compressXz(field)
                               : layout_.compression == kLz4 ? compressLz4(field)
                                                             : compressZstd(field);
   const uint64_t before = layout_.compact ? kCompactDataHeaderSize : kDataHeaderSize;
-  const uint64_t offset =
+  data.offset =
       beginObject(kData, compressed ? layout_.compression : uint8_t{0}, before + payload.size());
-  put<uint64_t>(offset + 16, hashOf(field));
-  put<uint64_t>(offset + kDataEntryCountAt, 1);
-  file_.replace(offset + before, payload.size(), payload);
-  data_.emplace(field, offset);
-  return offset;
+  data.list.firstAt = data.offset + kDataEntryArrayAt;
+  put<uint64_t>(data.offset + 16, hashOf(field));
+  file_.replace(data.offset + before, payload.size(), payload);
+  const uint64_t owner = fieldFor(field.substr(0, field.find('=')));
+  put<uint64_t>(data.offset + kNextValueAt, wordAt(owner + kFieldFirstValueAt));
+  put<uint64_t>(owner + kFieldFirstValueAt, data.offset);
+  return data;
+}
+
+uint64_t JournalWriter::fieldFor(const std::string& name) {
+  const auto [known, isNew] = fields_.try_emplace(name);
+  if (!isNew) return known->second;
+  const uint64_t field = beginObject(kField, 0, kFieldHeaderSize + name.size());
+  file_.replace(field + kFieldHeaderSize, name.size(), name);
+  const uint64_t bucket = wordAt(kFieldTableAt) + hashOf(name) % kBuckets * kBucketSize;
+  put<uint64_t>(field + kNextInBucketAt, wordAt(bucket));
+  put<uint64_t>(bucket, field);
+  if (layout_.headerSize >= kHeaderRead) put<uint64_t>(kFieldCountAt, fields_.size());
+  return known->second = field;
 }
 
 void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fields) {
-  std::vector<uint64_t> items;
+  std::vector<Data*> items;
   uint64_t hash = 0;
   for (const std::string& field : fields) {
-    items.push_back(dataFor(field));
+    items.push_back(&dataFor(field));
     hash ^= hashOf(field);
   }
-  std::sort(items.begin(), items.end());
+  std::sort(items.begin(), items.end(),
+            [](const Data* a, const Data* b) { return a->offset < b->offset; });
   sequence_ = header.sequenceNumber != 0 ? header.sequenceNumber : sequence_ + 1;
   const size_t itemSize = layout_.compact ? kCompactEntryItemSize : kEntryItemSize;
   const uint64_t offset = beginObject(kEntry, 0, kEntryItemsAt + items.size() * itemSize);
@@ -137,14 +154,12 @@ void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fiel
   std::copy(header.bootId.begin(), header.bootId.end(),
             file_.begin() + static_cast<ptrdiff_t>(offset + kEntryBootAt));
   put<uint64_t>(offset + kEntryHashAt, hash);
-  for (size_t i = 0; i < items.size(); ++i) {
-    putOffset(offset + kEntryItemsAt + i * itemSize, items[i]);
-    // A data object names the first entry that refers to it.
-    uint64_t first = 0;
-    std::memcpy(&first, file_.data() + items[i] + 40, sizeof first);
-    if (first == 0) put<uint64_t>(items[i] + 40, offset);
-  }
-  link(offset);
+  for (size_t i = 0; i < items.size(); ++i)
+    putOffset(offset + kEntryItemsAt + i * itemSize, items[i]->offset);
+  link(all_, offset);
+  entries_.push_back(offset);
+  put<uint64_t>(kEntryCountAt, entries_.size());
+  for (Data* item : items) link(*item, offset);
   if (entries_.size() == 1) {
     put<uint64_t>(168, sequence_);
     put<uint64_t>(kHeadRealtimeAt, header.realtime);
@@ -157,19 +172,26 @@ void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fiel
     beginObject(kTag, 0, kTagSize);
 }
 
-// Lists an entry in the chain of arrays, each twice as long as the one before.
-void JournalWriter::link(uint64_t entry) {
-  if (arrayUsed_ == arrayCapacity_) {
-    arrayCapacity_ = arrayCapacity_ == 0 ? 4 : arrayCapacity_ * 2;
-    arrayUsed_ = 0;
+void JournalWriter::link(List& list, uint64_t entry) {
+  if (list.used == list.capacity) {
+    list.capacity = list.capacity == 0 ? 4 : list.capacity * 2;
+    list.used = 0;
     const uint64_t array =
-        beginObject(kEntryArray, 0, kArrayItemsAt + arrayCapacity_ * offsetSize());
-    put<uint64_t>(arrays_.empty() ? kEntryArrayAt : arrays_.back() + kArrayNextAt, array);
-    arrays_.push_back(array);
+        beginObject(kEntryArray, 0, kArrayItemsAt + list.capacity * offsetSize());
+    put<uint64_t>(list.arrays.empty() ? list.firstAt : list.arrays.back() + kArrayNextAt, array);
+    list.arrays.push_back(array);
   }
-  putOffset(arrays_.back() + kArrayItemsAt + arrayUsed_++ * offsetSize(), entry);
-  entries_.push_back(entry);
-  put<uint64_t>(kEntryCountAt, entries_.size());
+  putOffset(list.arrays.back() + kArrayItemsAt + list.used++ * offsetSize(), entry);
+}
+
+// The first entry that refers to a value stands in the value itself.
+void JournalWriter::link(Data& data, uint64_t entry) {
+  if (data.entries++ == 0) {
+    put<uint64_t>(data.offset + kDataFirstEntryAt, entry);
+  } else {
+    link(data.list, entry);
+  }
+  put<uint64_t>(data.offset + kDataEntryCountAt, data.entries);
 }
 
 void JournalWriter::addSome(size_t count, uint64_t firstSequence) {

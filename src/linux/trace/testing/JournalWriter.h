@@ -37,12 +37,32 @@ class JournalWriter {
 
   // Offsets of what was written, to aim at.
   const std::vector<uint64_t>& entries() const { return entries_; }
-  const std::vector<uint64_t>& arrays() const { return arrays_; }
+  const std::vector<uint64_t>& arrays() const { return all_.arrays; }
+  uint64_t dataOf(const std::string& field) const { return data_.at(field).offset; }
+  const std::vector<uint64_t>& arraysOf(const std::string& field) const {
+    return data_.at(field).list.arrays;
+  }
 
  private:
+  // A chain of arrays of entries, each twice as long as the one before.
+  struct List {
+    uint64_t firstAt = 0;  // where the offset of the first array is put
+    std::vector<uint64_t> arrays;
+    uint64_t capacity = 0;  // of the last
+    uint64_t used = 0;
+  };
+  struct Data {
+    uint64_t offset = 0;
+    uint64_t entries = 0;
+    List list;
+  };
+
   uint64_t beginObject(uint8_t type, uint8_t flags, uint64_t size);
-  uint64_t dataFor(const std::string& field);
-  void link(uint64_t entry);
+  Data& dataFor(const std::string& field);
+  uint64_t fieldFor(const std::string& name);
+  void link(List& list, uint64_t entry);
+  void link(Data& data, uint64_t entry);
+  uint64_t wordAt(uint64_t at) const;
   template <typename T>
   void put(uint64_t at, T value);
   size_t offsetSize() const { return layout_.compact ? 4 : 8; }
@@ -50,11 +70,10 @@ class JournalWriter {
 
   JournalLayout layout_;
   std::string file_;
-  std::map<std::string, uint64_t> data_;
+  std::map<std::string, Data> data_;
+  std::map<std::string, uint64_t> fields_;
   std::vector<uint64_t> entries_;
-  std::vector<uint64_t> arrays_;
-  uint64_t arrayCapacity_ = 0;
-  uint64_t arrayUsed_ = 0;
+  List all_;
   uint64_t objects_ = 0;
   uint64_t sequence_ = 0;
 };
