@@ -136,11 +136,11 @@ void IntervalAssembler::deliverMerged(const PointTokens& begin,
 
 IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
   const bool system = table_.flag(point_[FieldKind::scope]);
-  return {table_.bootToken(header.bootId),
+  return {table_.identity(point_[FieldKind::intervalId]),
+          table_.bootToken(header.bootId),
           point_[FieldKind::subsystem],
           point_[FieldKind::category],
           point_[FieldKind::name],
-          point_[FieldKind::intervalId],
           system ? IntervalKey::kSystemScope : point_[FieldKind::process]};
 }
 
@@ -195,7 +195,7 @@ void IntervalAssembler::renewTokens(TracePointTable& table) {
     key.subsystem = token(FieldKind::subsystem);
     key.category = token(FieldKind::category);
     key.name = token(FieldKind::name);
-    key.id = token(FieldKind::intervalId);
+    key.id = table.identity(token(FieldKind::intervalId));
     if (key.process != IntervalKey::kSystemScope) key.process = token(FieldKind::process);
     return true;
   });

@@ -35,7 +35,8 @@ OpenIntervals::OpenIntervals(OpenIntervalLimits limits)
 uint32_t OpenIntervals::hashOf(const IntervalKey& key) const {
   uint64_t hash = mix(pairOf(key.boot, key.subsystem) ^ seed_, 0x9e3779b97f4a7c15u);
   hash = mix(pairOf(key.category, key.name) ^ hash, 0xd1b54a32d192ed03u ^ seed_);
-  hash = mix(pairOf(key.id, key.process) ^ hash, 0x8cb92ba72f3d8dd7u);
+  hash = mix(key.id ^ hash, 0x8cb92ba72f3d8dd7u);
+  hash = mix(key.process ^ hash, 0x9e3779b97f4a7c15u);
   return static_cast<uint32_t>(hash ^ (hash >> 32));
 }
 

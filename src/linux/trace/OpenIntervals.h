@@ -24,11 +24,11 @@ using PointTokens = std::array<FieldToken, kPointSlots>;
 struct IntervalKey {
   static constexpr FieldToken kSystemScope = ~FieldToken{0};
 
+  uint64_t id;  // TracePointTable::identity() of its token
   FieldToken boot;
   FieldToken subsystem;
   FieldToken category;
   FieldToken name;
-  FieldToken id;
   FieldToken process;
 
   bool operator==(const IntervalKey&) const = default;

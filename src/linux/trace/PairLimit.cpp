@@ -9,7 +9,7 @@ PairLimit::PairLimit(PairLimits limits)
 
 PairLimit::Pair& PairLimit::slotOf(const Pair& pair) {
   const size_t mask = slots_.size() - 1;
-  size_t at = (pair[0] + pair[1] * 0x9e3779b97f4a7c15u) & mask;
+  size_t at = (pair.subsystem + pair.category * 0x9e3779b97f4a7c15u) & mask;
   while (slots_[at] != Pair{} && slots_[at] != pair) at = (at + 1) & mask;
   return slots_[at];
 }

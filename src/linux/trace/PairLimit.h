@@ -7,7 +7,6 @@
 
 #pragma once
 
-#include <array>
 #include <cstdint>
 #include <vector>
 
@@ -30,7 +29,12 @@ class PairLimit {
   uint64_t refusals() const { return refusals_; }
 
  private:
-  using Pair = std::array<uint64_t, 2>;
+  struct Pair {
+    uint64_t subsystem = 0;
+    uint64_t category = 0;
+
+    bool operator==(const Pair&) const = default;
+  };
 
   Pair& slotOf(const Pair& pair);
 

@@ -2,6 +2,8 @@
 
 #include "linux/trace/TracePointTable.h"
 
+#include <charconv>
+
 #include "linux/trace/DecimalNumber.h"
 
 namespace tessel {
@@ -82,6 +84,8 @@ FieldToken TracePointTable::parse(FieldKind kind, std::string_view value) {
       return addOnce(malformedField(kind, MalformedReason::unknownScope));
     case FieldKind::telemetry:
       return addOnce(wholeField(kind, value == "1"));
+    case FieldKind::intervalId:
+      return parseId(value);
     case FieldKind::attribute:
       return parseAttribute(value);
     case FieldKind::number1Value:
@@ -120,6 +124,18 @@ FieldToken TracePointTable::parseNumber(FieldKind kind, std::string_view value) 
     field.whole = static_cast<uint64_t>(std::get<int64_t>(*number));
   }
   return kind == FieldKind::process ? addOnce(field) : add(field);
+}
+
+// Most ids are numbers that two entries have, so their texts are not worth keeping. A number as it
+// is usually spelled stands for itself; being odd, its identity is that of no text.
+FieldToken TracePointTable::parseId(std::string_view value) {
+  constexpr size_t kMostDigits = 18;
+  uint64_t number = 0;
+  const auto [end, error] = std::from_chars(value.data(), value.data() + value.size(), number);
+  if (value.empty() || value.front() == '0' || value.size() > kMostDigits || error != std::errc() ||
+      end != value.data() + value.size())
+    return textToken(FieldKind::intervalId, value);
+  return add(wholeField(FieldKind::intervalId, number * 2 + 1));
 }
 
 FieldToken TracePointTable::parseAttribute(std::string_view value) {

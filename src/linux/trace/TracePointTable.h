@@ -1,7 +1,8 @@
 // TracePointTable: each distinct FIELD=value of the store, parsed and interned once.
 //
 // A token is a kind of field and an index into the table. Equal values of a string, a process or a
-// boot have equal tokens, so whoever pairs or counts compares small integers. The table is bounded:
+// boot have equal tokens, equal ids of intervals equal identities, so whoever pairs or counts
+// compares integers. The table is bounded:
 // over its limits it is emptied between two entries and starts a new generation, with a new string
 // pool; delivered objects keep the old pool alive as long as they need it, and a TokenHolder takes
 // along what it holds.
@@ -54,6 +55,8 @@ class TracePointTable final : public FieldTokenizer {
 
   // The value of a token of this generation; what `kNoToken` stands for is absent.
   static FieldKind kind(FieldToken token) { return FieldKind(token >> kIndexBits); }
+  // Equal for equal values of one kind; 0 for what is absent.
+  uint64_t identity(FieldToken token) const { return at(token).identity(); }
   StringRef text(FieldToken token) const { return StringRef(at(token).record); }
   std::optional<Number> number(FieldToken token) const;
   // REQUIRES: the token is one of a duration or a frame rate.
@@ -90,7 +93,7 @@ class TracePointTable final : public FieldTokenizer {
     FieldKind kind = FieldKind::malformed;
     Form form = Form::none;
 
-    // Equal for equal values of one kind; a text is interned, so its record stands for it.
+    // A text is interned, so its record stands for it.
     uint64_t identity() const {
       return form == Form::text ? reinterpret_cast<uintptr_t>(record) : whole;
     }
@@ -116,6 +119,7 @@ class TracePointTable final : public FieldTokenizer {
   static Contents emptyContents(const TracePointTableLimits& limits);
   FieldToken parse(FieldKind kind, std::string_view value);
   FieldToken parseNumber(FieldKind kind, std::string_view value);
+  FieldToken parseId(std::string_view value);
   FieldToken parseAttribute(std::string_view value);
   FieldToken addAttribute(std::string_view key, std::string_view value);
   FieldToken textToken(FieldKind kind, std::string_view value);

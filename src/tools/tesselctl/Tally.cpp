@@ -3,7 +3,6 @@
 #include "tools/tesselctl/Tally.h"
 
 #include <algorithm>
-#include <bit>
 #include <ctime>
 #include <numeric>
 
@@ -65,9 +64,9 @@ void Tally::count(const TesselObject& object, const FilterDecision& decision,
 }
 
 void Tally::countPair(const TesselObject& object, TesselReporterClassification classification) {
-  const Borrowed<2> key{{object.subsystem(), object.category()}};
-  const auto known = pairs_.find(key);
-  ++(known != pairs_.end() ? known->second : pairs_[kept(key)])[classification];
+  const decltype(pairs_)::Key key{{object.subsystem(), object.category()}};
+  VerdictCounts* const known = pairs_.find(key);
+  ++(known != nullptr ? *known : pairs_.add(key))[classification];
 }
 
 void Tally::countKind(const TesselObject& object, bool reported) {
@@ -85,41 +84,27 @@ void Tally::countSlice(TesselReporterClassification classification, uint64_t rea
 }
 
 void Tally::countMiss(const TesselObject& object, const FilterDecision& decision) {
-  const Borrowed<4> key{
+  const decltype(misses_)::Key key{
       {object.subsystem(), object.category(), object.name(), decision.stringValue},
       decision.stringSlot};
-  MissSlot& slot = missSlotOf(key);
-  if (slot.number != 0) {
-    ++misses_[slot.number - 1].count;
+  if (uint64_t* const known = misses_.find(key)) {
+    ++*known;
     return;
   }
   size_t bytes = 0;
   for (const StringRef text : key.texts) bytes += text.textOr("").size();
-  if (misses_.size() >= kMaxMisses || missBytes_ + bytes > kMaxMissBytes) {
+  if (misses_.entries().size() >= kMaxMisses || missBytes_ + bytes > kMaxMissBytes) {
     ++missesNotListed_;
     return;
   }
   missBytes_ += bytes;
-  misses_.push_back({kept(key), 1});
-  slot = {static_cast<uint32_t>(Hash{}(key)), static_cast<uint32_t>(misses_.size())};
-}
-
-// The slot of the key, or the free one where it would stand.
-Tally::MissSlot& Tally::missSlotOf(const Borrowed<4>& key) {
-  static_assert(std::has_single_bit(kMaxMisses));
-  const auto hash = static_cast<uint32_t>(Hash{}(key));
-  const size_t mask = missSlots_.size() - 1;
-  for (size_t at = hash & mask;; at = (at + 1) & mask) {
-    MissSlot& slot = missSlots_[at];
-    if (slot.number == 0 || (slot.hash == hash && Equal{}(misses_[slot.number - 1].key, key)))
-      return slot;
-  }
+  misses_.add(key) = 1;
 }
 
 std::vector<Tally::Pair> Tally::pairs() const {
   std::vector<Pair> pairs;
-  for (const auto& [key, counts] : pairs_)
-    pairs.push_back({textOf(key.texts[0]), textOf(key.texts[1]), counts});
+  for (const auto& [texts, slot, counts] : pairs_.entries())
+    pairs.push_back({textOf(texts[0]), textOf(texts[1]), counts});
   std::sort(pairs.begin(), pairs.end(), [](const Pair& a, const Pair& b) {
     const uint64_t sumA = sumOf(a.counts);
     const uint64_t sumB = sumOf(b.counts);
@@ -131,9 +116,9 @@ std::vector<Tally::Pair> Tally::pairs() const {
 
 std::vector<Tally::Miss> Tally::misses() const {
   std::vector<Miss> misses;
-  for (const auto& [key, count] : misses_) {
-    misses.push_back({textOf(key.texts[0]), textOf(key.texts[1]), textOf(key.texts[2]), key.slot,
-                      textOf(key.texts[3]), count});
+  for (const auto& [texts, slot, count] : misses_.entries()) {
+    misses.push_back(
+        {textOf(texts[0]), textOf(texts[1]), textOf(texts[2]), slot, textOf(texts[3]), count});
   }
   std::sort(misses.begin(), misses.end(), [](const Miss& a, const Miss& b) {
     if (a.count != b.count) return a.count > b.count;

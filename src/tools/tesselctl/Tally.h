@@ -6,17 +6,16 @@
 
 #pragma once
 
-#include <algorithm>
 #include <array>
 #include <cstdint>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 #include <utility>
 #include <vector>
 
 #include "linux/trace/EntryStream.h"
 #include "linux/trace/ExtractionReport.h"
+#include "tools/tesselctl/KeyedCounts.h"
 #include "tools/tesselctl/TimeArguments.h"
 #include "tools/tesselctl/Verdict.h"
 
@@ -79,56 +78,6 @@ class Tally {
   const Period& period() const { return period_; }
 
  private:
-  // Strings that are taken together; absent ones are told apart from empty ones. They are looked
-  // for as they are borrowed and kept only once.
-  template <typename String, size_t N>
-  struct Key {
-    std::array<String, N> texts;
-    uint8_t slot = 0;
-  };
-  template <size_t N>
-  using Borrowed = Key<StringRef, N>;
-  template <size_t N>
-  using Kept = Key<SharedString, N>;
-  struct Hash {
-    using is_transparent = void;
-    template <typename String, size_t N>
-    size_t operator()(const Key<String, N>& key) const {
-      uint64_t hash = key.slot;
-      for (const StringRef text : key.texts) hash = hash * 0x9e3779b97f4a7c15u + text.hash();
-      return hash;
-    }
-  };
-  struct Equal {
-    using is_transparent = void;
-    template <typename A, typename B, size_t N>
-    bool operator()(const Key<A, N>& a, const Key<B, N>& b) const {
-      for (size_t at = 0; at < N; ++at) {
-        if (a.texts[at].present() != b.texts[at].present()) return false;
-        if (a.texts[at].present() && !sameString(a.texts[at], b.texts[at])) return false;
-      }
-      return a.slot == b.slot;
-    }
-  };
-  template <size_t N>
-  static Kept<N> kept(const Borrowed<N>& key) {
-    Kept<N> own;
-    std::copy(key.texts.begin(), key.texts.end(), own.texts.begin());
-    own.slot = key.slot;
-    return own;
-  }
-
-  // Open addressing over the misses. Where most values are unknown most are beyond the limit, and a
-  // search for one of those should end at once.
-  struct KeptMiss {
-    Kept<4> key;
-    uint64_t count = 0;
-  };
-  struct MissSlot {
-    uint32_t hash = 0;
-    uint32_t number = 0;  // of the miss, from 1 on; 0: the slot is free
-  };
-  MissSlot& missSlotOf(const Borrowed<4>& key);
   void countPair(const TesselObject& object, TesselReporterClassification classification);
   void countKind(const TesselObject& object, bool reported);
   void countSlice(TesselReporterClassification classification, uint64_t realtime);
@@ -137,9 +86,8 @@ class Tally {
   const Period period_;
   VerdictCounts verdicts_{};
   std::array<KindCounts, 3> kinds_{};
-  std::unordered_map<Kept<2>, VerdictCounts, Hash, Equal> pairs_;
-  std::vector<KeptMiss> misses_;
-  std::vector<MissSlot> missSlots_ = std::vector<MissSlot>(2 * kMaxMisses);
+  KeyedCounts<2, VerdictCounts> pairs_;
+  KeyedCounts<4, uint64_t> misses_;
   size_t missBytes_ = 0;
   uint64_t missesNotListed_ = 0;
   std::chrono::microseconds sliceLength_;
