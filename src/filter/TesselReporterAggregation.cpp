@@ -46,7 +46,7 @@ void TesselReporterAggregation::incrementSubsystem(StringRef subsystem, StringRe
     ++entries_[slots_[slot] - 1].count;
     return;
   }
-  if ((slotsTaken_ + 1) * 4 > slots_.size() * 3) {
+  if ((slotsTaken_ + 1) * 2 > slots_.size()) {
     makeRoom();
     slot = slotFor(subsystem, category);
   }

@@ -76,7 +76,7 @@ class TesselReporterAggregation {
   // A deque, so that keys stay where they are and no capacity for twice the pairs lies idle.
   std::deque<Entry> entries_;
   // Open addressing over the entries whose strings are present: one above the entry's index, 0 for
-  // a free slot. The size is 0 or a power of two, and at most three slots of four are taken.
+  // a free slot. The size is 0 or a power of two, and at most half of the slots are taken.
   std::vector<Index> slots_;
   size_t slotsTaken_ = 0;
   uint64_t totalCount_ = 0;

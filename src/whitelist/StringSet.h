@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include <cstdint>
 #include <initializer_list>
 #include <span>
 #include <string_view>
@@ -26,14 +27,13 @@ class StringSet {
   size_t size() const { return size_; }
 
  private:
-  struct Slot {
-    uint64_t hash = 0;
-    std::string_view text;  // a null view marks a free slot
-  };
   void add(std::string_view text);
+  size_t slotOf(std::string_view text, uint64_t hash) const;
 
-  // Open addressing; a power of two, with at least one slot free.
-  std::vector<Slot> slots_;
+  // Open addressing; a power of two, at most half of it taken. Most values that are asked about are
+  // members of no set: what tells that is kept together, apart from the texts.
+  std::vector<uint32_t> marks_;  // of the hash; 0: the slot is free
+  std::vector<std::string_view> texts_;
   size_t size_ = 0;
 };
 
