@@ -7,8 +7,16 @@ namespace tessel {
 
 using namespace journal_format;
 
+namespace {
+constexpr size_t kSmallestPiece = 256;  // bytes, as the largest
+constexpr size_t kLargestPiece = 4096;
+}  // namespace
+
 EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count)
-    : file_(file), itemSize_(file.header().compact() ? 4 : 8), count_(count) {
+    : file_(file),
+      itemSize_(file.header().compact() ? 4 : 8),
+      count_(count),
+      pieceBytes_(std::clamp(file.file().share() / 32, kSmallestPiece, kLargestPiece)) {
   if (!enterArray(first) && count_ != 0) damagedAt(first);
 }
 
@@ -57,7 +65,7 @@ bool EntryChain::loadPiece() {
     finishArray();
     return array_ != 0;
   }
-  uint64_t count = std::min<uint64_t>(arraySize_ - arrayIndex_, kPieceBytes / itemSize_);
+  uint64_t count = std::min<uint64_t>(arraySize_ - arrayIndex_, pieceBytes_ / itemSize_);
   // Items are linked in order, so what stands beyond the count was not linked when we looked.
   if (growing) count = std::min(count, count_ - listed_);
   if (!takePiece(static_cast<size_t>(count)))
@@ -71,7 +79,8 @@ bool EntryChain::loadPiece() {
 bool EntryChain::takePiece(size_t count) {
   pieceSize_ = pieceNext_ = 0;
   const uint64_t from = array_ + kArrayItemsAt + arrayIndex_ * itemSize_;
-  if (file_.file().read(from, {piece_.data(), count * itemSize_}) != count * itemSize_)
+  if (!piece_) piece_ = std::make_unique_for_overwrite<uint8_t[]>(pieceBytes_);
+  if (file_.file().read(from, {piece_.get(), count * itemSize_}) != count * itemSize_)
     return false;
   uint64_t previous = last_;
   for (size_t i = 0; i < count; ++i) {

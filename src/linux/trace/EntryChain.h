@@ -1,7 +1,7 @@
 // EntryChain: the offsets of entries as a chain of entry arrays of a journal file lists them: all
 // entries of the file, or those that refer to one data object.
 //
-// The chain is read in small pieces. A piece whose offsets are not all possible and strictly
+// The chain is read in pieces, small beside the windows of the files. A piece whose offsets are not all possible and strictly
 // increasing is not used at all, and a broken link ends the chain: in both cases the caller is told
 // that entries may lie in between, to look for them in line.
 //
@@ -9,9 +9,8 @@
 
 #pragma once
 
-#include <array>
 #include <cstdint>
-#include <optional>
+#include <memory>
 
 #include "linux/trace/JournalFile.h"
 
@@ -36,8 +35,6 @@ class EntryChain {
   uint64_t problemAt() const { return problemAt_; }
 
  private:
-  static constexpr size_t kPieceBytes = 512;
-
   uint64_t firstOfNextPiece();
   bool loadPiece();
   bool enterArray(uint64_t offset);
@@ -48,7 +45,7 @@ class EntryChain {
     problemAt_ = offset;
   }
   uint64_t itemAt(size_t index) const {
-    const uint8_t* item = piece_.data() + index * itemSize_;
+    const uint8_t* item = piece_.get() + index * itemSize_;
     return itemSize_ == 4 ? journal_format::load<uint32_t>(item)
                           : journal_format::load<uint64_t>(item);
   }
@@ -56,7 +53,8 @@ class EntryChain {
   JournalFile& file_;
   const size_t itemSize_;
   const uint64_t count_;
-  std::array<uint8_t, kPieceBytes> piece_;
+  const size_t pieceBytes_;
+  std::unique_ptr<uint8_t[]> piece_;  // from when the first is read
   size_t pieceSize_ = 0;  // in items
   size_t pieceNext_ = 0;
   uint64_t array_ = 0;       // offset of the array that is read; 0: none is left

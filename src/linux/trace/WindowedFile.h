@@ -46,6 +46,8 @@ class WindowedFile {
 
   // Bytes that the file had when it was opened, less once a read found it shorter.
   uint64_t size() const { return size_; }
+  // Bytes that the window may take.
+  size_t share() const { return budget_.share(); }
   // Whether a read failed or found the file shorter than it was.
   bool failed() const { return failed_; }
 
