@@ -1,9 +1,9 @@
 // Any bytes as a journal file. What is delivered must keep to the file's own limits: no entry
 // twice, no value beyond what is shown of one, an end.
 //
-// The tables of a real journal file are megabytes of zeros that the reader never looks at. An input
-// therefore begins with where such a stretch stands and how long it is, 32 bits each; the file is
-// made with a hole there.
+// A real journal file has a table of megabytes, mostly zeros, that the reader never looks at. An
+// input therefore begins with where such a stretch stands and how long it is, 32 bits each; the
+// file is made with a hole there.
 
 #include <sys/mman.h>
 #include <unistd.h>
@@ -15,6 +15,7 @@
 #include <memory>
 #include <span>
 #include <utility>
+#include <vector>
 
 #include "linux/trace/JournalEntryStream.h"
 #include "linux/trace/TracePointTable.h"
@@ -65,6 +66,7 @@ uint32_t nextNumber() {
 JournalReadResources& resources(uint32_t number) {
   static auto& kept = *new std::unique_ptr<JournalReadResources>;
   if (number == 0) kept = std::make_unique<JournalReadResources>();
+  kept->entryListsLeft = MarkedEntries::kMaxListsOfStore;
   return *kept;
 }
 
@@ -77,11 +79,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const auto* beginning = std::get_if<JournalBeginning>(&opened);
   if (beginning == nullptr) return 0;
   TracePointTable table({.fields = 64, .textBytes = size_t{64} << 10});
+  const std::vector<EntryMark> marks = table.marks();
   StopFlag stop = false;
   FileReport report;
   const uint32_t number = nextNumber();
   JournalEntryStream stream(UniqueFd(::dup(file)), beginning->fileSize, beginning->header, number,
-                            {resources(number), table, stop, report});
+                            {resources(number), table, marks, stop, report});
   readAll(stream, table, size / 8);
   if (report.problems.size() > FileReport::kMaxProblems + 1) std::abort();
   return 0;

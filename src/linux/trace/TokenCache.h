@@ -76,7 +76,8 @@ class TokenCache {
     }
     void store(uint64_t offset, FieldToken token) {
       const uint64_t key = keyOf(offset);
-      sets_[key >> kTagBits].second = {tagOf(key), token};
+      Set& set = sets_[key >> kTagBits];
+      (set.first.tag == tagOf(key) ? set.first : set.second) = {tagOf(key), token};
     }
 
    private:

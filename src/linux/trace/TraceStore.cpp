@@ -66,6 +66,8 @@ void SequenceWatch::change(const EntryHeader& entry) {
   }
 }
 
+static_assert(TraceStore::kMaxFiles <= TokenCache::kMaxFiles);
+
 // Of a stream whose entries may count in any sequence.
 constexpr Id128 kNoSequence{};
 

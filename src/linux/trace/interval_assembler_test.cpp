@@ -132,6 +132,13 @@ TEST_F(IntervalAssemblerTest, beginAndEndMatchOnTheirKey) {
       {"another name", {"begin|NAME=a", "end|NAME=b"}, {}},
       {"an absent name is not an empty one", {"begin", "end|NAME="}, {}},
       {"another id", {"begin|INTERVAL_ID=1", "end|INTERVAL_ID=2"}, {}},
+      {"a number as it is not usually spelled",
+       {"begin|INTERVAL_ID=7", "end|INTERVAL_ID=07", "end|INTERVAL_ID=+7", "end|INTERVAL_ID=7 "},
+       {}},
+      {"numbers of any length",
+       {"begin|INTERVAL_ID=7", "begin|INTERVAL_ID=18446744073709551623", "end|INTERVAL_ID=7",
+        "end|INTERVAL_ID=18446744073709551623"},
+       {interval, interval}},
       {"an absent id is an id of its own", {"begin|INTERVAL_ID=1", "end"}, {}},
       {"another process", {"begin|_PID=1", "end|_PID=2"}, {}},
       {"another process in process scope",
@@ -157,7 +164,7 @@ TEST_F(IntervalAssemblerTest, beginAndEndMatchOnTheirKey) {
   };
   for (const PairingCase& c : cases) {
     EXPECT_EQ(run(c.points), c.delivered) << c.what;
-    run({"end", "end|NAME=a", "end|INTERVAL_ID=1", "end|_PID=1",
+    run({"end", "end|NAME=a", "end|INTERVAL_ID=1", "end|INTERVAL_ID=7", "end|_PID=1",
          "end|_PID=1|INTERVAL_SCOPE=system"});
     EXPECT_EQ(assembler().counts().openIntervals, 0u) << c.what;
   }
