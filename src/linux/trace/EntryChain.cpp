@@ -8,15 +8,14 @@ namespace tessel {
 using namespace journal_format;
 
 namespace {
-constexpr size_t kSmallestPiece = 256;  // bytes, as the largest
-constexpr size_t kLargestPiece = 4096;
+constexpr size_t kSmallestPiece = 256;  // bytes
 }  // namespace
 
-EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count)
+EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count, size_t largestPiece)
     : file_(file),
       itemSize_(file.header().compact() ? 4 : 8),
       count_(count),
-      pieceBytes_(std::clamp(file.file().share() / 32, kSmallestPiece, kLargestPiece)) {
+      pieceBytes_(std::clamp(file.file().share() / 32, kSmallestPiece, largestPiece)) {
   if (!enterArray(first) && count_ != 0) damagedAt(first);
 }
 
@@ -80,8 +79,7 @@ bool EntryChain::takePiece(size_t count) {
   pieceSize_ = pieceNext_ = 0;
   const uint64_t from = array_ + kArrayItemsAt + arrayIndex_ * itemSize_;
   if (!piece_) piece_ = std::make_unique_for_overwrite<uint8_t[]>(pieceBytes_);
-  if (file_.file().read(from, {piece_.get(), count * itemSize_}) != count * itemSize_)
-    return false;
+  if (file_.file().read(from, {piece_.get(), count * itemSize_}) != count * itemSize_) return false;
   uint64_t previous = last_;
   for (size_t i = 0; i < count; ++i) {
     const uint64_t offset = itemAt(i);

@@ -1,9 +1,9 @@
 // EntryChain: the offsets of entries as a chain of entry arrays of a journal file lists them: all
 // entries of the file, or those that refer to one data object.
 //
-// The chain is read in pieces, small beside the windows of the files. A piece whose offsets are not all possible and strictly
-// increasing is not used at all, and a broken link ends the chain: in both cases the caller is told
-// that entries may lie in between, to look for them in line.
+// The chain is read in pieces, small beside the windows of the files. A piece whose offsets are not
+// all possible and strictly increasing is not used at all, and a broken link ends the chain: in
+// both cases the caller is told that entries may lie in between, to look for them in line.
 //
 // Threads: one at a time.
 
@@ -18,9 +18,12 @@ namespace tessel {
 
 class EntryChain {
  public:
+  static constexpr size_t kLargestPiece = 4096;  // bytes
+
   // The chain that begins with the array at `first` and lists `count` entries. `file` must outlive
   // the chain.
-  EntryChain(JournalFile& file, uint64_t first, uint64_t count);
+  EntryChain(JournalFile& file, uint64_t first, uint64_t count,
+             size_t largestPiece = kLargestPiece);
 
   // The offset of the next entry, greater than all before; 0 where the chain ends.
   uint64_t next() {
@@ -55,7 +58,7 @@ class EntryChain {
   const uint64_t count_;
   const size_t pieceBytes_;
   std::unique_ptr<uint8_t[]> piece_;  // from when the first is read
-  size_t pieceSize_ = 0;  // in items
+  size_t pieceSize_ = 0;              // in items
   size_t pieceNext_ = 0;
   uint64_t array_ = 0;       // offset of the array that is read; 0: none is left
   uint64_t nextArray_ = 0;   // the one it links to

@@ -15,6 +15,7 @@ namespace {
 constexpr uint64_t kMaxFields = 4096;
 constexpr size_t kMaxValues = 1024;
 constexpr size_t kMaxLists = 16;
+constexpr size_t kListPiece = 1024;  // bytes that are read of a list at once
 
 std::string_view textAt(const uint8_t* at, size_t size) {
   return {reinterpret_cast<const char*>(at), size};
@@ -153,8 +154,9 @@ bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_v
 bool MarkedEntries::IndexReader::addList(const uint8_t* data, uint64_t entries) {
   if (lists_.size() == kMaxLists) return false;
   const auto first = load<uint64_t>(data + kDataFirstEntryAt);
-  lists_.push_back({EntryChain(file_, load<uint64_t>(data + kDataEntryArrayAt), entries - 1),
-                    entries - 1, first});
+  lists_.push_back(
+      {EntryChain(file_, load<uint64_t>(data + kDataEntryArrayAt), entries - 1, kListPiece),
+       entries - 1, first});
   return first != 0;
 }
 

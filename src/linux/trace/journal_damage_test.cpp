@@ -10,7 +10,6 @@
 
 #include <algorithm>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <functional>
 #include <random>
@@ -28,6 +27,7 @@ namespace {
 using namespace journal_format;
 using testing::JournalLayout;
 using testing::JournalWriter;
+using testing::put;
 using testing::TemporaryDirectory;
 
 struct Outcome {
@@ -63,10 +63,6 @@ JournalWriter journalOf(size_t entries, JournalLayout layout = {}) {
   JournalWriter writer(layout);
   writer.addSome(entries);
   return writer;
-}
-
-void put(std::string& file, uint64_t at, uint64_t value) {
-  std::memcpy(file.data() + at, &value, sizeof value);
 }
 
 class JournalDamageTest : public ::testing::TestWithParam<bool> {

@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <cstdlib>
-#include <cstring>
 #include <functional>
 #include <set>
 
@@ -21,8 +20,9 @@ namespace {
 using namespace journal_format;
 using testing::JournalLayout;
 using testing::JournalWriter;
+using testing::put;
 
-constexpr size_t kEntries = 1000;
+constexpr size_t kJournalSize = 1000;
 constexpr const char* kLoss = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
 
 const std::vector<EntryMark> kMarks = {{"KIND", {}, {"SUBSYSTEM"}}};
@@ -42,9 +42,9 @@ void addEntry(JournalWriter& writer, std::vector<std::string> fields) {
 bool isMarked(uint64_t number) { return number % 5 == 0; }
 bool tellsOfLoss(uint64_t number) { return number % 100 == 1; }
 
-JournalWriter journalOf(JournalLayout layout) {
+JournalWriter markedJournal(JournalLayout layout) {
   JournalWriter writer(layout);
-  for (size_t i = 1; i <= kEntries; ++i) {
+  for (size_t i = 1; i <= kJournalSize; ++i) {
     if (isMarked(i)) {
       addEntry(writer, {i % 2 == 0 ? "KIND=event" : "KIND=begin", "SUBSYSTEM=a"});
     } else {
@@ -52,10 +52,6 @@ JournalWriter journalOf(JournalLayout layout) {
     }
   }
   return writer;
-}
-
-void put(std::string& file, uint64_t at, uint64_t value) {
-  std::memcpy(file.data() + at, &value, sizeof value);
 }
 
 uint64_t wordAt(const std::string& file, uint64_t at) {
@@ -94,29 +90,29 @@ INSTANTIATE_TEST_SUITE_P(Layouts, MarkedEntriesTest, ::testing::Bool());
 
 TEST_P(MarkedEntriesTest, ShowsMarkedEntriesAndThoseThatTellOfALossAndNoOthers) {
   Numbers expected;
-  for (uint64_t i = 1; i <= kEntries; ++i)
+  for (uint64_t i = 1; i <= kJournalSize; ++i)
     if (isMarked(i) || tellsOfLoss(i)) expected.insert(i);
-  EXPECT_EQ(shown(journalOf(layout()).bytes()), expected);
+  EXPECT_EQ(shown(markedJournal(layout()).bytes()), expected);
 }
 
 TEST_P(MarkedEntriesTest, ShowsEveryEntryWhereTheIndexDoesNotTell) {
-  JournalWriter writer = journalOf(layout());
+  JournalWriter writer = markedJournal(layout());
   addEntry(writer, {"SUBSYSTEM=b"});
-  EXPECT_EQ(shown(writer.bytes()).size(), kEntries + 1) << "a companion alone";
+  EXPECT_EQ(shown(writer.bytes()).size(), kJournalSize + 1) << "a companion alone";
   for (const char* field : {"SUBSYSTEM=", "KIND=", "NAME"}) {
-    JournalWriter many = journalOf(layout());
+    JournalWriter many = markedJournal(layout());
     for (int i = 0; i < 5000; ++i) addEntry(many, {field + std::to_string(i) + "=x"});
-    EXPECT_EQ(shown(many.bytes()).size(), kEntries + 5000) << "too many of " << field;
+    EXPECT_EQ(shown(many.bytes()).size(), kJournalSize + 5000) << "too many of " << field;
   }
   for (const JournalLayout& other :
        {JournalLayout{.compact = GetParam(), .state = kOnline},
         JournalLayout{.compact = GetParam(), .headerSize = 208},
         JournalLayout{.compact = GetParam(), .compression = kZstd, .compressFrom = 8}})
-    EXPECT_EQ(shown(journalOf(other).bytes()).size(), kEntries);
+    EXPECT_EQ(shown(markedJournal(other).bytes()).size(), kJournalSize);
 }
 
 TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
-  const JournalWriter writer = journalOf(layout());
+  const JournalWriter writer = markedJournal(layout());
   const std::string good = writer.bytes();
   const uint64_t buckets = wordAt(good, kFieldTableAt);
   const uint64_t data = writer.dataOf("KIND=event");
@@ -134,9 +130,9 @@ TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
       {"value zeroed", [&](auto& file) { file.replace(data, 64, 64, '\0'); }},
       {"no entries", [&](auto& file) { put(file, data + kDataEntryCountAt, 0); }},
       {"one entry less",
-       [&](auto& file) { put(file, data + kDataEntryCountAt, kEntries / 10 - 1); }},
+       [&](auto& file) { put(file, data + kDataEntryCountAt, kJournalSize / 10 - 1); }},
       {"one entry more",
-       [&](auto& file) { put(file, data + kDataEntryCountAt, kEntries / 10 + 1); }},
+       [&](auto& file) { put(file, data + kDataEntryCountAt, kJournalSize / 10 + 1); }},
       {"first entry is none", [&](auto& file) { put(file, data + kDataFirstEntryAt, data); }},
       {"list elsewhere", [&](auto& file) { put(file, data + kDataEntryArrayAt, data); }},
       {"list cut off", [&](auto& file) { put(file, arrays[1] + kArrayNextAt, 0); }},
@@ -154,28 +150,28 @@ TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
     std::string file = good;
     fault(file);
     const Numbers seen = shown(file);
-    for (uint64_t i = 1; i <= kEntries; ++i)
+    for (uint64_t i = 1; i <= kJournalSize; ++i)
       EXPECT_TRUE(!isMarked(i) || seen.contains(i)) << name << " " << i;
   }
 }
 
 // An offset in a list that leads to no entry may hide the one that it stood for, and no other.
 TEST_P(MarkedEntriesTest, LosesOneEntryAtMostWhereAnOffsetIsWrongAndTellsOfIt) {
-  const JournalWriter writer = journalOf(layout());
+  const JournalWriter writer = markedJournal(layout());
   std::string file = writer.bytes();
   const uint64_t item = writer.arraysOf("KIND=event")[3] + kArrayItemsAt;
   file[item] = static_cast<char>(file[item] + 8);
   const Numbers seen = shown(file);
   uint64_t found = 0;
   for (const uint64_t number : seen) found += isMarked(number);
-  EXPECT_EQ(found, kEntries / 5 - 1);
+  EXPECT_EQ(found, kJournalSize / 5 - 1);
   EXPECT_EQ(problem_, "list of entries damaged");
 }
 
 TEST_P(MarkedEntriesTest, LosesNextToNothingToRandomDamage) {
   const char* wanted = std::getenv("TESSEL_DAMAGE_ROUNDS");
   const uint64_t rounds = wanted != nullptr ? std::strtoull(wanted, nullptr, 10) : 100;
-  const std::string file = journalOf(layout()).bytes();
+  const std::string file = markedJournal(layout()).bytes();
   for (uint64_t seed = 0; seed < rounds; ++seed) {
     const std::string damaged = testing::damaged(file, seed);
     const Numbers there = shown(damaged, {}, "KIND=");

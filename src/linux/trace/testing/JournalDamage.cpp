@@ -92,6 +92,10 @@ class Vandal {
 
 }  // namespace
 
+void put(std::string& file, uint64_t at, uint64_t value) {
+  std::memcpy(file.data() + at, &value, sizeof value);
+}
+
 std::string damaged(const std::string& file, uint64_t seed) { return Vandal(file, seed).work(); }
 
 }  // namespace tessel::testing

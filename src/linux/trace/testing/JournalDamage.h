@@ -11,4 +11,7 @@ namespace tessel::testing {
 // end, links and offsets that point elsewhere, sizes and counts that are too large.
 std::string damaged(const std::string& file, uint64_t seed);
 
+// Writes the word at an offset of a file that is held in memory.
+void put(std::string& file, uint64_t at, uint64_t value);
+
 }  // namespace tessel::testing
