@@ -77,7 +77,8 @@ bool JournalEntryStream::take(uint64_t offset) {
   firstFresh_ = searchedTo_;
   searchedTo_ = alignUp(offset + size);
   ++delivered_;
-  entryMarked_ = marked_ == nullptr || isMarked(offset);
+  // What was added since the header was read may be in no list yet.
+  entryMarked_ = marked_ == nullptr || delivered_ > file_.header().entryCount || isMarked(offset);
   return true;
 }
 
@@ -108,6 +109,8 @@ void JournalEntryStream::endSearch() {
 void JournalEntryStream::finish() {
   if (std::exchange(reported_, true)) return;
   const uint64_t expected = file_.header().entryCount;
+  if (marked_ && marked_->awaitsMore() && delivered_ <= expected)
+    context_.report.addProblem("list of entries damaged", file_.objectsEnd());
   // The daemon cuts off what it has not used of a file when it closes it; that costs nothing.
   if (file_.file().failed() && (expected > delivered_ || !context_.report.problems.empty()))
     context_.report.addProblem("cut short or not readable", file_.file().size());

@@ -13,6 +13,7 @@ namespace {
 
 // A file with more fields, or more values of a marked one, is read without its index.
 constexpr uint64_t kMaxFields = 4096;
+constexpr uint64_t kMaxFieldTable = uint64_t{1} << 20;  // bytes
 constexpr size_t kMaxValues = 1024;
 constexpr size_t kMaxLists = 16;
 constexpr size_t kListPiece = 1024;  // bytes that are read of a list at once
@@ -77,7 +78,8 @@ bool MarkedEntries::IndexReader::readObject(uint64_t offset, ObjectType type, si
 bool MarkedEntries::IndexReader::findFields() {
   const JournalHeader& header = file_.header();
   std::array<uint8_t, 4096> buckets;
-  if (header.fieldTableSize % kBucketSize != 0 || header.fieldTable < kObjectHeaderSize ||
+  if (header.fieldTableSize > kMaxFieldTable || header.fieldTableSize % kBucketSize != 0 ||
+      header.fieldTable < kObjectHeaderSize ||
       !readObject(header.fieldTable - kObjectHeaderSize, kFieldHashTable, kObjectHeaderSize,
                   std::span(buckets).first(kObjectHeaderSize)) ||
       load<uint64_t>(buckets.data() + kObjectSizeAt) != kObjectHeaderSize + header.fieldTableSize)
@@ -139,8 +141,8 @@ bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_v
     const std::string_view text =
         textAt(bytes.data() + headerSize, std::min<uint64_t>(size, bytes.size() - headerSize));
     const auto count = load<uint64_t>(bytes.data() + kDataEntryCountAt);
-    if (!text.starts_with(name) || text[name.size()] != '=' || count == 0 ||
-        count > file_.header().entryCount)
+    if (text.size() <= name.size() || !text.starts_with(name) || text[name.size()] != '=' ||
+        count == 0 || count > file_.header().entryCount)
       return false;
     const bool counts =
         value.empty() || (size == text.size() && text.substr(name.size() + 1) == value);
@@ -156,8 +158,8 @@ bool MarkedEntries::IndexReader::addList(const uint8_t* data, uint64_t entries) 
   const auto first = load<uint64_t>(data + kDataFirstEntryAt);
   lists_.push_back(
       {EntryChain(file_, load<uint64_t>(data + kDataEntryArrayAt), entries - 1, kListPiece),
-       entries - 1, first});
-  return first != 0;
+       entries - 1, first, 0});
+  return first != 0 && lookAhead(lists_.back());
 }
 
 std::unique_ptr<MarkedEntries> MarkedEntries::of(JournalFile& file,
@@ -186,13 +188,17 @@ bool MarkedEntries::look(uint64_t offset) {
 }
 
 // False where the list goes on in a place that is damaged, or beyond its end.
-bool MarkedEntries::advance(List& list) {
-  const uint64_t next = list.rest.next();
+bool MarkedEntries::lookAhead(List& list) {
+  const uint64_t ahead = list.rest.next();
   const bool more = list.left != 0;
   list.left -= more;
-  const bool sound = !list.rest.gapBefore() && (next != 0) == more && (!more || next > list.next);
-  list.next = more ? next : kNone;
-  return sound;
+  list.ahead = more ? ahead : kNone;
+  return !list.rest.gapBefore() && (ahead != 0) == more && (!more || ahead > list.next);
+}
+
+bool MarkedEntries::advance(List& list) {
+  list.next = list.ahead;
+  return list.next == kNone || lookAhead(list);
 }
 
 }  // namespace tessel

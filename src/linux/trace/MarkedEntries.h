@@ -42,6 +42,8 @@ class MarkedEntries {
   bool usable() const { return usable_; }
   // Whether that is because a place that they list held no entry: one may have been passed over.
   bool missed() const { return missed_; }
+  // Whether an entry is listed that was not asked about yet.
+  bool awaitsMore() const { return nearest_ != kNone; }
 
  private:
   static constexpr uint64_t kNone = UINT64_MAX;
@@ -50,12 +52,15 @@ class MarkedEntries {
     EntryChain rest;    // behind the first entry, which the value itself names
     uint64_t left = 0;  // of `rest`
     uint64_t next = 0;  // offset of the entry that comes next; kNone: there is none
+    // The one behind it, so that an offset that is too large is found before it is waited for.
+    uint64_t ahead = 0;
   };
 
   class IndexReader;
 
   bool look(uint64_t offset);
-  bool advance(List& list);
+  static bool lookAhead(List& list);
+  static bool advance(List& list);
 
   std::vector<List> lists_;
   uint64_t nearest_ = 0;  // the least `next`

@@ -75,6 +75,7 @@ class TokenCache {
       return set.first.token;
     }
     void store(uint64_t offset, FieldToken token) {
+      if (offset > kMaxOffset) return;
       const uint64_t key = keyOf(offset);
       Set& set = sets_[key >> kTagBits];
       (set.first.tag == tagOf(key) ? set.first : set.second) = {tagOf(key), token};

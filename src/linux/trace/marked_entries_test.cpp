@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <cstring>
 #include <functional>
 #include <set>
 
@@ -119,6 +120,7 @@ TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
   const uint64_t newest = std::max(data, writer.dataOf("KIND=begin"));
   const std::vector<uint64_t>& arrays = writer.arraysOf("KIND=event");
   const size_t item = layout().compact ? 4 : 8;
+  const uint64_t far = good.size() - 64;
   using Fault = std::function<void(std::string&)>;
   const std::pair<const char*, Fault> faults[] = {
       {"field table elsewhere", [&](auto& file) { put(file, kFieldTableAt, buckets + 8); }},
@@ -134,6 +136,11 @@ TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
       {"one entry more",
        [&](auto& file) { put(file, data + kDataEntryCountAt, kJournalSize / 10 + 1); }},
       {"first entry is none", [&](auto& file) { put(file, data + kDataFirstEntryAt, data); }},
+      {"first entry is far behind", [&](auto& file) { put(file, data + kDataFirstEntryAt, far); }},
+      {"last of an array is far behind",
+       [&](auto& file) {
+         std::memcpy(file.data() + arrays[2] + kArrayItemsAt + 15 * item, &far, item);
+       }},
       {"list elsewhere", [&](auto& file) { put(file, data + kDataEntryArrayAt, data); }},
       {"list cut off", [&](auto& file) { put(file, arrays[1] + kArrayNextAt, 0); }},
       {"list in a circle", [&](auto& file) { put(file, arrays[2] + kArrayNextAt, arrays[0]); }},
