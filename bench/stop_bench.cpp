@@ -15,7 +15,7 @@
 #include <thread>
 #include <vector>
 
-#include "linux/trace/JournalExtractor.h"
+#include "trace/JournalExtractor.h"
 
 namespace {
 

@@ -1,5 +1,5 @@
-// Any bytes as the metadata of a bundle. An input that begins with 'd' is the name of a desktop file,
-// with 'n' the name of a metadata file, anything else is what a metadata file holds.
+// Any bytes as the metadata of a bundle. An input that begins with 'd' is the name of a desktop
+// file, with 'n' the name of a metadata file, anything else is what a metadata file holds.
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -19,7 +19,8 @@ namespace fs = std::filesystem;
 
 const fs::path& directory() {
   static const auto& made = *new fs::path([] {
-    std::string name = fs::is_directory("/dev/shm") ? "/dev/shm/bundle.XXXXXX" : "/tmp/bundle.XXXXXX";
+    std::string name =
+        fs::is_directory("/dev/shm") ? "/dev/shm/bundle.XXXXXX" : "/tmp/bundle.XXXXXX";
     if (::mkdtemp(name.data()) == nullptr) std::abort();
     return name;
   }());

@@ -8,8 +8,8 @@
 #include <cstdint>
 #include <cstdlib>
 
-#include "linux/trace/ExportEntryStream.h"
-#include "linux/trace/TracePointTable.h"
+#include "journal/ExportEntryStream.h"
+#include "trace/TracePointTable.h"
 
 namespace {
 

@@ -17,9 +17,9 @@
 #include <utility>
 #include <vector>
 
-#include "linux/trace/JournalEntryStream.h"
-#include "linux/trace/TracePointTable.h"
-#include "linux/trace/TraceStore.h"
+#include "journal/JournalEntryStream.h"
+#include "journal/TraceStore.h"
+#include "trace/TracePointTable.h"
 
 namespace {
 

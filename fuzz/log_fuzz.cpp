@@ -7,9 +7,9 @@
 #include <string>
 #include <string_view>
 
-#include "linux/PlainText.h"
 #include "platform/LogFormat.h"
 #include "platform/Payload.h"
+#include "platform/PlainText.h"
 
 namespace {
 
@@ -60,8 +60,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const auto number = take<uint64_t>(rest);
   const auto real = take<double>(rest);
   const std::string_view word = rest.substr(0, rest.find('|'));
-  const std::string line = formatLogArguments("%@/%s: %llu %f %.2f",
-                                              {word, std::string(word), number, real, real});
+  const std::string line =
+      formatLogArguments("%@/%s: %llu %f %.2f", {word, std::string(word), number, real, real});
   if (!line.starts_with(std::string(word) + "/")) std::abort();
   if (line.find(": " + std::to_string(number)) == std::string::npos) std::abort();
   const std::string shown = plainText(line, "\\x0a");

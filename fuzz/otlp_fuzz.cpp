@@ -7,9 +7,9 @@
 #include <nlohmann/json.hpp>
 #include <string_view>
 
-#include "linux/PlainText.h"
-#include "tools/forwarder/OtlpBody.h"
-#include "tools/forwarder/Policy.h"
+#include "forwarder/OtlpBody.h"
+#include "forwarder/Policy.h"
+#include "platform/PlainText.h"
 
 namespace {
 

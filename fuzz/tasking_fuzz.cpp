@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <string_view>
 
-#include "linux/statora/ConfigurationJson.h"
+#include "statora/ConfigurationJson.h"
 #include "tasking/TaskingGate.h"
 
 namespace {

@@ -8,8 +8,8 @@
 #include <string_view>
 #include <vector>
 
-#include "linux/trace/IntervalAssembler.h"
-#include "linux/trace/TracePointTable.h"
+#include "trace/IntervalAssembler.h"
+#include "trace/TracePointTable.h"
 
 namespace {
 

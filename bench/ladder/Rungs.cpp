@@ -8,9 +8,9 @@
 #include <optional>
 #include <string_view>
 
-#include "linux/trace/JournalExtractor.h"
-#include "linux/trace/TracePointTable.h"
-#include "linux/trace/TraceStore.h"
+#include "journal/TraceStore.h"
+#include "trace/JournalExtractor.h"
+#include "trace/TracePointTable.h"
 
 namespace tessel::bench {
 

@@ -8,8 +8,8 @@
 #include <system_error>
 #include <vector>
 
-#include "linux/Files.h"
-#include "linux/PlainText.h"
+#include "os/Files.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

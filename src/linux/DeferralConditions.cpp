@@ -10,7 +10,7 @@
 #include <utility>
 #include <vector>
 
-#include "linux/Files.h"
+#include "os/Files.h"
 
 namespace tessel {
 

@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <system_error>
 
-#include "linux/PlainText.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

@@ -13,8 +13,8 @@
 #include <string>
 #include <tuple>
 
-#include "linux/Files.h"
-#include "linux/UniqueFd.h"
+#include "os/Files.h"
+#include "os/UniqueFd.h"
 
 namespace tessel {
 

@@ -8,9 +8,9 @@
 #include <sys/uio.h>
 #include <systemd/sd-journal.h>
 
-#include "linux/Files.h"
 #include "linux/MessageIds.h"
-#include "linux/PlainText.h"
+#include "os/Files.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

@@ -4,7 +4,7 @@
 
 #include <algorithm>
 
-#include "linux/Files.h"
+#include "os/Files.h"
 
 namespace tessel {
 

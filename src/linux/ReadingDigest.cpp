@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <string_view>
 
-#include "linux/PlainText.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "linux/trace/ExtractionReport.h"
+#include "trace/ExtractionReport.h"
 
 namespace tessel {
 

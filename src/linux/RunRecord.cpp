@@ -8,8 +8,8 @@
 #include <nlohmann/json.hpp>
 #include <numeric>
 
-#include "linux/DurableFile.h"
-#include "linux/PlainText.h"
+#include "os/DurableFile.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

@@ -6,7 +6,7 @@
 
 #include <utility>
 
-#include "linux/PlainText.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

@@ -12,9 +12,9 @@
 #include <filesystem>
 #include <system_error>
 
-#include "linux/DurableFile.h"
-#include "linux/Files.h"
-#include "linux/PlainText.h"
+#include "os/DurableFile.h"
+#include "os/Files.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
 

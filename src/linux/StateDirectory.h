@@ -17,7 +17,7 @@
 #include <utility>
 #include <variant>
 
-#include "linux/UniqueFd.h"
+#include "os/UniqueFd.h"
 #include "platform/Clock.h"
 
 namespace tessel {

@@ -8,7 +8,7 @@
 #include <filesystem>
 #include <map>
 
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

@@ -11,7 +11,7 @@
 #include <thread>
 
 #include "linux/RunSchedule.h"
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/testing/TemporaryDirectory.h"
 #include "platform/testing/Fakes.h"
 
 namespace tessel {

@@ -6,7 +6,7 @@
 
 #include <filesystem>
 
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

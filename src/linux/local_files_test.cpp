@@ -12,8 +12,8 @@
 
 #include <filesystem>
 
-#include "linux/UniqueFd.h"
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/UniqueFd.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

@@ -9,8 +9,8 @@
 #include <cstring>
 
 #include "linux/LogSinks.h"
-#include "linux/UniqueFd.h"
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/UniqueFd.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

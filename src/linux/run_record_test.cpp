@@ -7,7 +7,7 @@
 #include <filesystem>
 #include <nlohmann/json.hpp>
 
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

@@ -5,7 +5,7 @@
 #include "linux/IcuDates.h"
 #include "linux/MountTable.h"
 #include "linux/OsReleaseBuildVariant.h"
-#include "linux/testing/TemporaryDirectory.h"
+#include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {
 namespace {

@@ -7,11 +7,15 @@ namespace tessel {
 bool TesselSupportObject::isKindOf(TesselClass wanted) const {
   if (class_ == wanted) return true;
   switch (wanted) {
-    case TesselClass::supportObject: return true;
-    case TesselClass::object: return class_ != TesselClass::supportObject;
-    case TesselClass::interval: return class_ == TesselClass::animationInterval;
+    case TesselClass::supportObject:
+      return true;
+    case TesselClass::object:
+      return class_ != TesselClass::supportObject;
+    case TesselClass::interval:
+      return class_ == TesselClass::animationInterval;
     case TesselClass::event:
-    case TesselClass::animationInterval: return false;
+    case TesselClass::animationInterval:
+      return false;
   }
   return false;
 }

@@ -70,7 +70,8 @@ struct TracePointFields {
 
 class TesselObject : public TesselSupportObject {
  public:
-  explicit TesselObject(TracePointFields fields) : TesselObject(TesselClass::object, std::move(fields)) {}
+  explicit TesselObject(TracePointFields fields)
+      : TesselObject(TesselClass::object, std::move(fields)) {}
 
   StringRef subsystem() const { return fields_.subsystem; }
   StringRef category() const { return fields_.category; }

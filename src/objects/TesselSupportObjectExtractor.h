@@ -29,7 +29,8 @@ struct PlatformError {
 };
 
 using IntervalCallback = std::function<bool(const std::shared_ptr<const TesselInterval>&)>;
-using AnimationIntervalCallback = std::function<bool(const std::shared_ptr<const TesselAnimationInterval>&)>;
+using AnimationIntervalCallback =
+    std::function<bool(const std::shared_ptr<const TesselAnimationInterval>&)>;
 using EventCallback = std::function<bool(const std::shared_ptr<const TesselEvent>&)>;
 
 class TesselSupportObjectExtractor {
@@ -37,15 +38,16 @@ class TesselSupportObjectExtractor {
   virtual ~TesselSupportObjectExtractor() = default;
 
   virtual void setIntervalCompletionProcessingBlock(IntervalCallback callback) = 0;
-  virtual void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) = 0;
+  virtual void setAnimationIntervalCompletionProcessingBlock(
+      AnimationIntervalCallback callback) = 0;
   virtual void setEmitEventProcessingBlock(EventCallback callback) = 0;
   virtual void setBuildAnimationCompositeIntervalTimelines(bool build) = 0;
 
   // Delivers the trace points recorded in [startDate, endDate) from the store at `path`, the
   // system's own where it is absent. Blocks until all are delivered or a stop took effect. False
   // where processing failed; `errorOut` then holds why.
-  virtual bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate, Date endDate,
-                                         std::optional<PlatformError>& errorOut) = 0;
+  virtual bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
+                                         Date endDate, std::optional<PlatformError>& errorOut) = 0;
   // Ends the processing call early. A stop before the call began makes it return at once.
   virtual void stopProcessing() = 0;
   // Log events that the last processing call read, trace points or not.

@@ -23,11 +23,11 @@
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
 #include "linux/SystemClock.h"
-#include "linux/statora/FileConfigurationService.h"
-#include "linux/statora/Spool.h"
-#include "linux/trace/JournalExtractor.h"
 #include "platform/WorkerQueue.h"
 #include "service/ReporterActivity.h"
+#include "statora/FileConfigurationService.h"
+#include "statora/Spool.h"
+#include "trace/JournalExtractor.h"
 
 namespace tessel {
 namespace {

@@ -15,9 +15,9 @@
 #include <string_view>
 #include <thread>
 
-#include "linux/trace/EntryCursor.h"
-#include "linux/trace/TraceStore.h"
-#include "linux/trace/testing/JournalOracle.h"
+#include "journal/EntryCursor.h"
+#include "journal/TraceStore.h"
+#include "journal/testing/JournalOracle.h"
 
 namespace {
 

@@ -1,0 +1,153 @@
+// One request with libcurl.
+
+#include "forwarder/CurlCollector.h"
+
+#include <curl/curl.h>
+#include <zlib.h>
+
+#include <algorithm>
+
+namespace tessel {
+
+namespace {
+
+// Beyond this an answer is cut off.
+constexpr size_t kMostRead = size_t{16} << 20;
+// Fastest level: it takes a body of records to a tenth, and slower ones not to much less.
+constexpr int kCompressionLevel = 1;
+constexpr int kGzipWindow = 15 + 16;
+
+struct Reading {
+  std::string body;
+  size_t received = 0;
+};
+
+size_t takeBody(char* bytes, size_t /*one*/, size_t count, void* target) {
+  auto& reading = *static_cast<Reading*>(target);
+  reading.received += count;
+  reading.body.append(bytes, std::min(count, Collector::kMaxAnswerBytes - reading.body.size()));
+  return reading.received > kMostRead ? 0 : count;
+}
+
+int checkCancelled(void* flag, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
+  return static_cast<const std::atomic<bool>*>(flag)->load() ? 1 : 0;
+}
+
+// A gzip stream that is used for one body after another.
+class Gzip {
+ public:
+  Gzip() {
+    good_ = deflateInit2(&stream_, kCompressionLevel, Z_DEFLATED, kGzipWindow, 8,
+                         Z_DEFAULT_STRATEGY) == Z_OK;
+  }
+  Gzip(const Gzip&) = delete;
+  Gzip& operator=(const Gzip&) = delete;
+  ~Gzip() { deflateEnd(&stream_); }
+
+  bool compress(std::string_view text, std::string& out) {
+    if (!good_ || deflateReset(&stream_) != Z_OK) return false;
+    out.resize(deflateBound(&stream_, text.size()));
+    // zlib does not write to its input.
+    stream_.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+    stream_.avail_in = static_cast<uInt>(text.size());
+    stream_.next_out = reinterpret_cast<Bytef*>(out.data());
+    stream_.avail_out = static_cast<uInt>(out.size());
+    const bool done = deflate(&stream_, Z_FINISH) == Z_STREAM_END;
+    out.resize(stream_.total_out);
+    return done;
+  }
+
+ private:
+  z_stream stream_{};
+  bool good_ = false;
+};
+
+}  // namespace
+
+struct CurlCollector::Handles {
+  CURL* request = curl_easy_init();
+  curl_slist* headers = nullptr;
+  Gzip gzip;
+  std::string compressed;
+  char reason[CURL_ERROR_SIZE] = "";
+
+  Handles() = default;
+  Handles(const Handles&) = delete;
+  Handles& operator=(const Handles&) = delete;
+  ~Handles() {
+    curl_easy_cleanup(request);
+    curl_slist_free_all(headers);
+  }
+
+  template <typename Value>
+  void set(CURLoption option, Value value) {
+    curl_easy_setopt(request, option, value);
+  }
+  void setFile(CURLoption option, const std::string& path) {
+    if (!path.empty()) set(option, path.c_str());
+  }
+  void setHeaders(const ForwarderSettings& settings) {
+    headers = curl_slist_append(headers, "Content-Type: application/json");
+    headers = curl_slist_append(headers, "Expect:");
+    if (settings.compress) headers = curl_slist_append(headers, "Content-Encoding: gzip");
+    for (const std::string& header : settings.headers)
+      headers = curl_slist_append(headers, header.c_str());
+    set(CURLOPT_HTTPHEADER, headers);
+  }
+};
+
+CurlCollector::CurlCollector(const ForwarderSettings& settings)
+    : compress_(settings.compress), handles_(std::make_unique<Handles>()) {
+  Handles& to = *handles_;
+  to.set(CURLOPT_URL, settings.url.c_str());
+  to.set(CURLOPT_PROTOCOLS_STR, "http,https");
+  to.set(CURLOPT_FOLLOWLOCATION, 0L);
+  to.set(CURLOPT_TIMEOUT_MS, static_cast<long>(settings.timeout.count()));
+  to.set(CURLOPT_NOSIGNAL, 1L);
+  to.set(CURLOPT_USERAGENT, "statora_forwarder/" TESSEL_VERSION);
+  to.set(CURLOPT_POST, 1L);
+  to.set(CURLOPT_WRITEFUNCTION, &takeBody);
+  to.set(CURLOPT_ERRORBUFFER, to.reason);
+  to.set(CURLOPT_NOPROGRESS, 0L);
+  to.set(CURLOPT_XFERINFOFUNCTION, &checkCancelled);
+  to.set(CURLOPT_XFERINFODATA, &cancelled_);
+  to.setFile(CURLOPT_CAINFO, settings.authorities);
+  to.setFile(CURLOPT_SSLCERT, settings.clientCertificate);
+  to.setFile(CURLOPT_SSLKEY, settings.clientKey);
+  to.setHeaders(settings);
+}
+
+CurlCollector::~CurlCollector() = default;
+
+CollectorAnswer CurlCollector::post(std::string_view body) {
+  Handles& with = *handles_;
+  std::string_view sent = body;
+  if (compress_) {
+    if (!with.gzip.compress(body, with.compressed))
+      return {0, {}, "the body cannot be compressed", {}, 0};
+    sent = with.compressed;
+  }
+  Reading reading;
+  with.reason[0] = '\0';
+  with.set(CURLOPT_POSTFIELDS, sent.data());
+  with.set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(sent.size()));
+  with.set(CURLOPT_WRITEDATA, &reading);
+  const CURLcode result = curl_easy_perform(with.request);
+
+  CollectorAnswer answer;
+  answer.bytesSent = sent.size();
+  answer.body = std::move(reading.body);
+  const bool cutOff = result == CURLE_WRITE_ERROR && reading.received > kMostRead;
+  if (result != CURLE_OK && !cutOff) {
+    answer.error = with.reason[0] != '\0' ? with.reason : curl_easy_strerror(result);
+    return answer;
+  }
+  curl_easy_getinfo(with.request, CURLINFO_RESPONSE_CODE, &answer.status);
+  curl_off_t seconds = 0;
+  if (curl_easy_getinfo(with.request, CURLINFO_RETRY_AFTER, &seconds) == CURLE_OK && seconds > 0) {
+    answer.retryAfter = std::chrono::seconds{seconds};
+  }
+  return answer;
+}
+
+}  // namespace tessel

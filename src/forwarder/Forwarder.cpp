@@ -1,0 +1,161 @@
+// Delivering batch after batch.
+
+#include "forwarder/Forwarder.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/Log.h"
+
+namespace tessel {
+
+namespace {
+
+// Free space is given back in steps that are over before the service would notice, with room for
+// its sends between them, and no more of them at a time than new events can wait for.
+constexpr int kPagesGivenBackAtOnce = 64;
+constexpr int kStepsAtOnce = 50;
+constexpr std::chrono::milliseconds kBetweenSteps{20};
+
+}  // namespace
+
+Forwarder::Forwarder(World world, OtlpBody body, const ForwarderOptions& options)
+    : world_(std::move(world)),
+      body_(std::move(body)),
+      options_(options),
+      backoff_(options.firstRetry, options.longestRetry),
+      pace_(options.recordsPerSecond) {}
+
+ForwarderOutcome Forwarder::deliverAll() {
+  refusals_ = 0;
+  reason_.clear();
+  for (;;) {
+    std::vector<SpooledEvent> events = world_.state.oldest(options_.maxRecords, options_.maxBytes);
+    if (SqliteStatus status = world_.state.status(); !status.ok()) {
+      reason_ = status.reason;
+      return ForwarderOutcome::spoolFailed;
+    }
+    if (events.empty()) break;
+    const Batch batch = cutBatch(std::move(events), world_.state.spoolId(), options_.maxBytes);
+    if (const ForwarderOutcome outcome = deliverBatch(batch);
+        outcome != ForwarderOutcome::delivered) {
+      world_.state.storeCounters();
+      return outcome;
+    }
+    sayProgress();
+  }
+  for (int step = 0; step < kStepsAtOnce; ++step) {
+    if (!world_.state.shrink(kPagesGivenBackAtOnce) || !takeBreak(kBetweenSteps)) break;
+  }
+  return ForwarderOutcome::delivered;
+}
+
+ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
+  for (const SpooledEvent& event : batch.malformed) {
+    if (!setAside(event, 0, "the payload is not a flat JSON object")) return outcome_;
+  }
+  std::vector<Records> parts;
+  if (!batch.records.empty()) parts.emplace_back(batch.records);
+  while (!parts.empty()) {
+    const Records part = parts.back();
+    parts.pop_back();
+    switch (send(part)) {
+      case Sent::accepted:
+        break;
+      case Sent::failed:
+        return outcome_;
+      case Sent::refused:
+        parts.push_back(part.subspan(part.size() / 2));
+        parts.push_back(part.first(part.size() / 2));
+        break;
+    }
+  }
+  return ForwarderOutcome::delivered;
+}
+
+Forwarder::Sent Forwarder::send(Records part) {
+  const std::string body = body_.around(part);
+  for (uint32_t failures = 1;; ++failures) {
+    if (!takeBreak(pace_.waitAt(ticks()))) return fail(ForwarderOutcome::stopped, "asked to stop");
+    pace_.sent(part.size(), ticks());
+    const CollectorAnswer answer = world_.collector.post(body);
+    ForwarderCounters& counters = world_.state.counters();
+    ++counters.requests;
+    counters.bytesSent += answer.bytesSent;
+    const Verdict verdict = verdictOn(answer);
+    if (verdict == Verdict::accepted || verdict == Verdict::refused) return settle(part, answer);
+    if (verdict == Verdict::hold) return fail(ForwarderOutcome::held, answerWords(answer));
+    if (failures == options_.maxAttempts)
+      return fail(ForwarderOutcome::unreachable, answerWords(answer));
+    if (!waitToRetry(answer, failures)) return fail(ForwarderOutcome::stopped, "asked to stop");
+  }
+}
+
+bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
+  const std::string words = answerWords(answer);
+  if (failures == 1) tesselReporterLog().error("The collector takes nothing for now: %@", words);
+  world_.status.say("Waiting for the collector: " + words);
+  ++world_.state.counters().retries;
+  world_.state.storeCounters();
+  return takeBreak(backoff_.wait(failures, world_.chance(), answer.retryAfter));
+}
+
+Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
+  if (verdictOn(answer) == Verdict::refused) {
+    if (part.size() > 1) return Sent::refused;
+    if (!setAside(part.front().event, answer.status, answerWords(answer))) return Sent::failed;
+    if (++refusals_ < options_.refusalsInARow) return Sent::accepted;
+    return fail(ForwarderOutcome::held, "record after record is refused: " + answerWords(answer));
+  }
+  refusals_ = 0;
+  const PartialSuccess partial = partialSuccess(answer.body);
+  if (partial.rejected > 0) {
+    world_.state.counters().rejected += partial.rejected;
+    tesselReporterLog().error("The collector rejected %llu records: %@", partial.rejected,
+                              partial.message);
+  }
+  std::vector<int64_t> ids;
+  for (const OutgoingRecord& record : part) ids.push_back(record.event.id);
+  const SqliteStatus status = world_.state.acknowledge(ids, world_.clock.now());
+  return status.ok() ? Sent::accepted : fail(ForwarderOutcome::spoolFailed, status.reason);
+}
+
+bool Forwarder::setAside(const SpooledEvent& event, int64_t status, const std::string& words) {
+  const SqliteStatus stored = world_.state.setAside(event, status, words, world_.clock.now());
+  if (!stored.ok()) {
+    fail(ForwarderOutcome::spoolFailed, stored.reason);
+    return false;
+  }
+  tesselReporterLog().error("Event %@ is set aside: %@", std::to_string(event.id), words);
+  return true;
+}
+
+// Waits; false where it is to stop.
+bool Forwarder::takeBreak(std::chrono::nanoseconds time) {
+  if (!world_.clock.wait(world_.stop, time)) return true;
+  // Whoever else waits is to stop, too.
+  world_.stop.signal();
+  return false;
+}
+
+Forwarder::Sent Forwarder::fail(ForwarderOutcome outcome, std::string reason) {
+  outcome_ = outcome;
+  reason_ = std::move(reason);
+  return Sent::failed;
+}
+
+void Forwarder::sayProgress() {
+  const ForwarderCounters& counters = world_.state.counters();
+  world_.status.progress();
+  world_.status.say("Delivered " + std::to_string(counters.delivered) + ", waiting " +
+                    std::to_string(world_.state.waiting()) + ", set aside " +
+                    std::to_string(counters.setAside));
+}
+
+std::chrono::nanoseconds Forwarder::ticks() {
+  const Timebase base = world_.clock.timebase();
+  return std::chrono::nanoseconds{world_.clock.continuousTicks() * base.numerator /
+                                  base.denominator};
+}
+
+}  // namespace tessel

@@ -1,0 +1,97 @@
+// Verdicts, waits and pace.
+
+#include "forwarder/Policy.h"
+
+#include <algorithm>
+#include <charconv>
+#include <cmath>
+#include <nlohmann/json.hpp>
+
+#include "platform/PlainText.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr std::chrono::seconds kLongestAsked{3600};
+constexpr size_t kMaxWords = 300;
+
+// A 64-bit integer is a decimal string in OTLP's JSON, but not everybody writes it so.
+uint64_t integerOf(const nlohmann::json& value) {
+  if (value.is_number_unsigned()) return value.get<uint64_t>();
+  uint64_t number = 0;
+  if (const auto* text = value.get_ptr<const std::string*>()) {
+    std::from_chars(text->data(), text->data() + text->size(), number);
+  }
+  return number;
+}
+
+}  // namespace
+
+Verdict verdictOn(const CollectorAnswer& answer) {
+  switch (answer.status) {
+    case 0:
+    case 429:
+    case 502:
+    case 503:
+    case 504:
+      return Verdict::later;
+    case 401:
+    case 403:
+    case 404:
+    case 405:
+    case 407:
+      return Verdict::hold;
+    default:
+      break;
+  }
+  if (answer.status / 100 == 2) return Verdict::accepted;
+  return answer.status / 100 == 3 ? Verdict::hold : Verdict::refused;
+}
+
+PartialSuccess partialSuccess(std::string_view body) {
+  const auto json = nlohmann::json::parse(body, nullptr, false);
+  if (!json.is_object()) return {};
+  const auto partial = json.find("partialSuccess");
+  if (partial == json.end() || !partial->is_object()) return {};
+  PartialSuccess told;
+  if (const auto rejected = partial->find("rejectedLogRecords"); rejected != partial->end()) {
+    told.rejected = integerOf(*rejected);
+  }
+  if (const auto message = partial->find("errorMessage");
+      message != partial->end() && message->is_string()) {
+    told.message = message->get<std::string>();
+  }
+  return told;
+}
+
+std::string answerWords(const CollectorAnswer& answer) {
+  if (answer.status == 0) return plainText(answer.error, " ");
+  std::string words = std::to_string(answer.status);
+  if (!answer.body.empty())
+    words += ": " + plainText(std::string_view(answer.body).substr(0, kMaxWords), " ");
+  return words;
+}
+
+std::chrono::milliseconds Backoff::wait(uint32_t failures, double chance,
+                                        std::optional<std::chrono::seconds> asked) const {
+  const double doublings = std::min(failures - 1, uint32_t{30});
+  const double full = std::min(static_cast<double>(first_.count()) * std::exp2(doublings),
+                               static_cast<double>(most_.count()));
+  const std::chrono::milliseconds own{static_cast<int64_t>(full * (0.5 + chance / 2))};
+  if (!asked) return own;
+  const std::chrono::milliseconds wanted = std::min(*asked, kLongestAsked);
+  const auto spread = static_cast<double>(std::max(first_, wanted / 2).count());
+  return wanted + std::chrono::milliseconds{static_cast<int64_t>(chance * spread)};
+}
+
+std::chrono::nanoseconds Pace::waitAt(std::chrono::nanoseconds now) const {
+  return std::max(next_ - now, std::chrono::nanoseconds{0});
+}
+
+void Pace::sent(uint64_t records, std::chrono::nanoseconds now) {
+  if (recordsPerSecond_ == 0) return;
+  next_ = now + std::chrono::nanoseconds{std::chrono::seconds{1}} * records / recordsPerSecond_;
+}
+
+}  // namespace tessel

@@ -1,0 +1,233 @@
+// Reading the forwarder's variables.
+
+#include "forwarder/Settings.h"
+
+#include <arpa/inet.h>
+#include <curl/curl.h>
+
+#include <algorithm>
+#include <charconv>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <string_view>
+#include <utility>
+
+#include "os/Files.h"
+#include "platform/PlainText.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr size_t kMaxCredentialBytes = size_t{64} << 10;
+
+using Headers = std::vector<std::string>;
+
+struct Variable {
+  std::string name;
+  std::string value;
+};
+
+// Reads variables and remembers the first that makes no sense.
+class Variables {
+ public:
+  explicit Variables(const EnvironmentReader& environment) : environment_(environment) {}
+
+  // A variable that is set to nothing counts as one that is not set.
+  std::optional<std::string> value(const std::string& name) const {
+    std::optional<std::string> text = environment_(name);
+    if (text && text->empty()) text.reset();
+    return text;
+  }
+  // OTEL_EXPORTER_OTLP_LOGS_<name>, else OTEL_EXPORTER_OTLP_<name>.
+  std::optional<Variable> standard(const std::string& name) const {
+    for (const char* prefix : {"OTEL_EXPORTER_OTLP_LOGS_", "OTEL_EXPORTER_OTLP_"}) {
+      if (auto text = value(prefix + name)) return Variable{prefix + name, std::move(*text)};
+    }
+    return {};
+  }
+  std::string path(const std::string& name) const {
+    return standard(name).value_or(Variable{}).value;
+  }
+  void complain(const std::string& name, const std::string& text, const char* expected) {
+    if (!error_) error_ = LaunchError{name, text, expected};
+  }
+  // A whole number from `least` on.
+  std::optional<int64_t> number(const std::string& name, int64_t least) {
+    const auto text = value(name);
+    if (!text) return {};
+    int64_t parsed = 0;
+    const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), parsed);
+    if (error == std::errc() && end == text->data() + text->size() && parsed >= least &&
+        parsed <= 31'536'000) {
+      return parsed;
+    }
+    complain(name, *text, "a whole number up to 31536000");
+    return {};
+  }
+  bool flag(const std::string& name) {
+    const std::string text = value(name).value_or("0");
+    if (text != "0" && text != "1") complain(name, text, "0 or 1");
+    return text == "1";
+  }
+  const std::optional<LaunchError>& error() const { return error_; }
+
+ private:
+  const EnvironmentReader& environment_;
+  std::optional<LaunchError> error_;
+};
+
+// `text` with %XX decoded; nothing where that yields what a header cannot hold.
+std::optional<std::string> headerText(std::string_view text) {
+  std::string out;
+  for (size_t at = 0; at < text.size(); ++at) {
+    char byte = text[at];
+    if (byte == '%') {
+      unsigned decoded = 0;
+      if (at + 2 >= text.size() ||
+          std::from_chars(text.data() + at + 1, text.data() + at + 3, decoded, 16).ptr !=
+              text.data() + at + 3) {
+        return {};
+      }
+      byte = static_cast<char>(decoded);
+      at += 2;
+    }
+    if (static_cast<unsigned char>(byte) < 0x20 || byte == 0x7f) return {};
+    out += byte;
+  }
+  return out;
+}
+
+// name=value,name=value, percent-encoded.
+std::optional<Headers> parseHeaders(std::string_view text) {
+  Headers headers;
+  while (!text.empty()) {
+    const std::string_view member = trimmed(text.substr(0, text.find(',')));
+    text.remove_prefix(std::min(
+        text.find(',') == std::string_view::npos ? text.size() : text.find(',') + 1, text.size()));
+    if (member.empty()) continue;
+    const size_t equals = member.find('=');
+    if (equals == 0 || equals == std::string_view::npos) return {};
+    const auto name = headerText(trimmed(member.substr(0, equals)));
+    const auto value = headerText(trimmed(member.substr(equals + 1)));
+    if (!name || !value || name->find(':') != std::string::npos) return {};
+    headers.push_back(*name + ": " + *value);
+  }
+  return headers;
+}
+
+using CurlUrl = std::unique_ptr<CURLU, decltype(&curl_url_cleanup)>;
+
+std::string urlPart(CURLU* url, CURLUPart part) {
+  char* text = nullptr;
+  if (curl_url_get(url, part, &text, 0) != CURLUE_OK) return {};
+  const std::unique_ptr<char, decltype(&curl_free)> owned(text, &curl_free);
+  return text;
+}
+
+bool isLoopback(const std::string& host) {
+  if (host == "localhost" || host == "[::1]") return true;
+  in_addr address{};
+  return inet_pton(AF_INET, host.c_str(), &address) == 1 && (ntohl(address.s_addr) >> 24) == 127;
+}
+
+// Whether `text` is a URL that may be posted to.
+bool acceptable(const std::string& text, bool allowHttp) {
+  const CurlUrl url(curl_url(), &curl_url_cleanup);
+  if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return false;
+  const std::string scheme = urlPart(url.get(), CURLUPART_SCHEME);
+  if (scheme == "https") return true;
+  return scheme == "http" && (allowHttp || isLoopback(urlPart(url.get(), CURLUPART_HOST)));
+}
+
+void readEndpoint(Variables& variables, ForwarderSettings& settings) {
+  const bool allowHttp = variables.flag("TESSEL_FORWARD_ALLOW_HTTP");
+  const auto endpoint = variables.standard("ENDPOINT");
+  if (!endpoint) {
+    variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
+    return;
+  }
+  settings.url = endpoint->value;
+  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
+    while (settings.url.ends_with('/')) settings.url.pop_back();
+    settings.url += "/v1/logs";
+  }
+  if (!acceptable(settings.url, allowHttp)) {
+    variables.complain(
+        endpoint->name, endpoint->value,
+        "an https URL, or an http one to loopback (to any host with TESSEL_FORWARD_ALLOW_HTTP=1)");
+  }
+}
+
+void addHeaders(Variables& variables, ForwarderSettings& settings, const std::string& source,
+                std::string_view text) {
+  const auto headers = parseHeaders(text);
+  if (!headers)
+    return variables.complain(source, "(not shown)", "name=value,name=value, percent-encoded");
+  settings.headers.insert(settings.headers.end(), headers->begin(), headers->end());
+}
+
+void readCredentials(Variables& variables, ForwarderSettings& settings) {
+  const auto directory = variables.value("CREDENTIALS_DIRECTORY");
+  if (!directory) return;
+  if (const auto text = readSmallFile(*directory + "/otlp-headers", kMaxCredentialBytes)) {
+    addHeaders(variables, settings, "otlp-headers in CREDENTIALS_DIRECTORY", trimmed(*text));
+  }
+  const auto useFile = [&](std::string& target, const char* name) {
+    std::error_code ignored;
+    const std::string path = *directory + "/" + name;
+    if (target.empty() && std::filesystem::exists(path, ignored)) target = path;
+  };
+  useFile(settings.authorities, "otlp-certificate");
+  useFile(settings.clientCertificate, "otlp-client-certificate");
+  useFile(settings.clientKey, "otlp-client-key");
+}
+
+void readTransport(Variables& variables, ForwarderSettings& settings) {
+  if (const auto headers = variables.standard("HEADERS")) {
+    addHeaders(variables, settings, headers->name, headers->value);
+  }
+  if (const auto timeout = variables.standard("TIMEOUT")) {
+    settings.timeout = std::chrono::milliseconds{variables.number(timeout->name, 1).value_or(1)};
+  }
+  if (const auto compression = variables.standard("COMPRESSION")) {
+    settings.compress = compression->value == "gzip";
+    if (!settings.compress && compression->value != "none") {
+      variables.complain(compression->name, compression->value, "gzip or none");
+    }
+  }
+  if (const auto protocol = variables.standard("PROTOCOL");
+      protocol && protocol->value != "http/json") {
+    variables.complain(protocol->name, protocol->value,
+                       "http/json, the one protocol that is spoken here");
+  }
+  settings.authorities = variables.path("CERTIFICATE");
+  settings.clientCertificate = variables.path("CLIENT_CERTIFICATE");
+  settings.clientKey = variables.path("CLIENT_KEY");
+}
+
+}  // namespace
+
+std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
+    const EnvironmentReader& environment) {
+  ForwarderSettings settings;
+  Variables variables(environment);
+  readEndpoint(variables, settings);
+  readTransport(variables, settings);
+  readCredentials(variables, settings);
+  const auto seconds = [&variables](const char* name, auto& target, int64_t least) {
+    if (const auto value = variables.number(name, least)) target = std::chrono::seconds{*value};
+  };
+  seconds("TESSEL_FORWARD_SPREAD", settings.spread, 0);
+  seconds("TESSEL_FORWARD_INTERVAL", settings.interval, 1);
+  seconds("TESSEL_FORWARD_RETRY", settings.retry, 1);
+  if (const auto rate = variables.number("TESSEL_FORWARD_RATE", 0)) {
+    settings.recordsPerSecond = static_cast<uint64_t>(*rate);
+  }
+  settings.sendInstanceId = variables.flag("TESSEL_FORWARD_INSTANCE_ID");
+  if (variables.error()) return *variables.error();
+  return settings;
+}
+
+}  // namespace tessel

@@ -1,0 +1,253 @@
+// The forwarder: reads the spool and ships it, and nothing else.
+
+#include <curl/curl.h>
+#include <signal.h>
+#include <sysexits.h>
+
+#include <CLI/CLI.hpp>
+#include <cstdio>
+#include <iostream>
+#include <random>
+
+#include "forwarder/Batch.h"
+#include "forwarder/CurlCollector.h"
+#include "forwarder/Forwarder.h"
+#include "forwarder/Settings.h"
+#include "linux/LogSinks.h"
+#include "linux/ProcessSetup.h"
+#include "linux/ServiceManager.h"
+#include "linux/SystemClock.h"
+#include "linux/ThreadSignalSource.h"
+#include "platform/Semaphore.h"
+#include "platform/WorkerQueue.h"
+
+namespace tessel {
+namespace {
+
+struct Arguments {
+  bool once = false;
+  bool dryRun = false;
+  bool requeue = false;
+};
+
+double chance() {
+  static std::mt19937_64 random{std::random_device{}()};
+  return std::uniform_real_distribution<double>(0, 1)(random);
+}
+
+OtlpBody bodyFor(const LaunchConfiguration& launch, bool sendInstanceId) {
+  ResourceFacts facts = readResourceFacts(launch.osReleasePath);
+  if (sendInstanceId) facts.instanceId = applicationInstanceId();
+  return OtlpBody(facts);
+}
+
+// Prints the bodies of everything that waits, one a line, as they would be sent without a failure.
+int dryRun(const LaunchConfiguration& launch, bool sendInstanceId) {
+  const OtlpBody body = bodyFor(launch, sendInstanceId);
+  const ForwarderOptions options;
+  ForwarderState state(launch.stateDirectory);
+  if (const SqliteStatus status = state.openReadOnly(); !status.ok()) {
+    std::cerr << "The spool cannot be read: " << status.reason << '\n';
+    return EX_NOINPUT;
+  }
+  for (int64_t after = 0;;) {
+    std::vector<SpooledEvent> events = state.oldest(options.maxRecords, options.maxBytes, after);
+    if (events.empty()) return state.status().ok() ? 0 : EX_IOERR;
+    const Batch batch = cutBatch(std::move(events), state.spoolId(), options.maxBytes);
+    after = batch.lastId;
+    if (!batch.records.empty()) std::cout << body.around(batch.records) << '\n';
+  }
+}
+
+int requeue(const std::string& stateDirectory) {
+  ForwarderState state(stateDirectory);
+  SqliteStatus status = state.open();
+  const auto rows = status.ok() ? state.requeue() : std::nullopt;
+  if (!rows) {
+    std::cerr << "Nothing was put back: " << (status.ok() ? state.status() : status).reason << '\n';
+    return EX_IOERR;
+  }
+  std::cout << *rows << " events wait again\n";
+  return 0;
+}
+
+// Ends waiting and the request under way at SIGTERM and SIGINT.
+void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
+  const auto queue = std::make_shared<WorkerQueue>("statora_forwarder signal queue");
+  for (const int signalNumber : {SIGTERM, SIGINT}) {
+    const auto source = std::make_shared<ThreadSignalSource>(signalNumber, queue);
+    source->setHandler([&stop, &collector] {
+      collector.cancel();
+      stop.signal();
+    });
+    source->resume();
+  }
+}
+
+int exitStatus(ForwarderOutcome outcome) {
+  switch (outcome) {
+    case ForwarderOutcome::delivered:
+    case ForwarderOutcome::stopped:
+      return 0;
+    case ForwarderOutcome::unreachable:
+      return EX_TEMPFAIL;
+    case ForwarderOutcome::held:
+      return EX_UNAVAILABLE;
+    case ForwarderOutcome::spoolFailed:
+      return EX_NOINPUT;
+  }
+  return EX_SOFTWARE;
+}
+
+// Tells the log, once for each, why nothing moves.
+class Complaints {
+ public:
+  void tell(const std::string& words) {
+    if (words != last_ && !words.empty()) tesselReporterLog().error("%@", words);
+    last_ = words;
+  }
+
+ private:
+  std::string last_;
+};
+
+std::string complaint(ForwarderOutcome outcome, const std::string& reason) {
+  switch (outcome) {
+    case ForwarderOutcome::delivered:
+    case ForwarderOutcome::stopped:
+      return {};
+    case ForwarderOutcome::unreachable:
+      return "The collector cannot be reached: " + reason;
+    case ForwarderOutcome::held:
+      return "The collector takes nothing: " + reason;
+    case ForwarderOutcome::spoolFailed:
+      return "The spool cannot be used: " + reason;
+  }
+  return {};
+}
+
+class Service {
+ public:
+  Service(const LaunchConfiguration& launch, const ForwarderSettings& settings, Semaphore& stop,
+          Collector& collector)
+      : settings_(settings),
+        stop_(stop),
+        state_(launch.stateDirectory),
+        manager_(connectServiceManager(clock_)),
+        body_(bodyFor(launch, settings.sendInstanceId)),
+        collector_(collector) {}
+
+  int runOnce() {
+    if (!state_.exists()) return 0;  // nothing was ever sent
+    ForwarderOptions options = optionsFor(settings_);
+    options.maxAttempts = kAttemptsAtOnce;
+    return exitStatus(attempt(options));
+  }
+
+  int runForEver() {
+    manager_->ready();
+    manager_->say("Waiting for its turn in the fleet");
+    const std::chrono::duration<double> turn = settings_.spread * chance();
+    bool stopped = clock_.wait(stop_, std::chrono::duration_cast<std::chrono::nanoseconds>(turn));
+    while (!stopped) {
+      const ForwarderOutcome outcome =
+          state_.exists() ? attempt(optionsFor(settings_)) : ForwarderOutcome::delivered;
+      stopped = outcome == ForwarderOutcome::stopped ||
+                clock_.wait(stop_, outcome == ForwarderOutcome::held ? kHold : settings_.interval);
+    }
+    manager_->stopping();
+    return 0;
+  }
+
+ private:
+  static constexpr uint32_t kAttemptsAtOnce = 8;
+  static constexpr std::chrono::seconds kHold{300};
+
+  static ForwarderOptions optionsFor(const ForwarderSettings& settings) {
+    ForwarderOptions options;
+    options.firstRetry = settings.retry;
+    options.recordsPerSecond = settings.recordsPerSecond;
+    return options;
+  }
+
+  ForwarderOutcome attempt(const ForwarderOptions& options) {
+    std::string words;
+    ForwarderOutcome outcome = ForwarderOutcome::spoolFailed;
+    if (const SqliteStatus opened = state_.open(); opened.ok()) {
+      Forwarder forwarder({state_, collector_, clock_, *manager_, stop_, chance}, body_, options);
+      outcome = forwarder.deliverAll();
+      words = complaint(outcome, forwarder.reason());
+    } else {
+      words = complaint(outcome, opened.reason);
+    }
+    complaints_.tell(words);
+    manager_->say(words.empty() ? "Delivered what there was" : words);
+    return outcome;
+  }
+
+  const ForwarderSettings& settings_;
+  Semaphore& stop_;
+  SystemClock clock_;
+  ForwarderState state_;
+  std::unique_ptr<ServiceManager> manager_;
+  const OtlpBody body_;
+  Collector& collector_;
+  Complaints complaints_;
+};
+
+int forward(const LaunchConfiguration& launch, const ForwarderSettings& settings, bool once) {
+  curl_global_init(CURL_GLOBAL_DEFAULT);
+  // Used by the signal thread for as long as the process lives.
+  auto& stop = *new Semaphore(0);
+  auto& collector = *new CurlCollector(settings);
+  stopOnSignals(stop, collector);
+  Service service(launch, settings, stop, collector);
+  return once ? service.runOnce() : service.runForEver();
+}
+
+int complain(const LaunchError& error) {
+  std::cerr << error.line() << '\n';
+  return EX_CONFIG;
+}
+
+int run(const Arguments& arguments) {
+  const EnvironmentReader environment = processEnvironment();
+  const auto launch = readLaunchConfiguration(environment);
+  if (const auto* error = std::get_if<LaunchError>(&launch)) return complain(*error);
+  const auto& configuration = std::get<LaunchConfiguration>(launch);
+  static LogSink* const sink = makeLogSink(configuration.logDestination).release();
+  setLogSink(sink, configuration.logLevel);
+  if (arguments.requeue) return requeue(configuration.stateDirectory);
+  if (arguments.dryRun)
+    return dryRun(configuration, environment("TESSEL_FORWARD_INSTANCE_ID") == "1");
+  const auto settings = readForwarderSettings(environment);
+  if (const auto* error = std::get_if<LaunchError>(&settings)) return complain(*error);
+  return forward(configuration, std::get<ForwarderSettings>(settings), arguments.once);
+}
+
+}  // namespace
+}  // namespace tessel
+
+int main(int argc, char** argv) {
+  tessel::prepareProcess();
+  tessel::blockSignal(SIGTERM);
+  CLI::App app("Ships the events of the spool to an OpenTelemetry collector (OTLP/HTTP, JSON).");
+  app.set_version_flag("--version", TESSEL_VERSION);
+  app.footer(
+      "Where to is OTEL_EXPORTER_OTLP_ENDPOINT's to say. See what would be sent:\n  "
+      "statora_forwarder --dry-run");
+  tessel::Arguments arguments;
+  auto* const once = app.add_flag("--once", arguments.once, "Deliver what waits now, then end");
+  auto* const dryRun = app.add_flag("--dry-run", arguments.dryRun,
+                                    "Print the bodies of the requests; send and change nothing");
+  auto* const requeue = app.add_flag("--requeue", arguments.requeue,
+                                     "Let what was set aside wait for delivery again, then end");
+  once->excludes(dryRun, requeue);
+  dryRun->excludes(requeue);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& error) {
+    return app.exit(error) == 0 ? 0 : EX_USAGE;
+  }
+  return tessel::run(arguments);
+}

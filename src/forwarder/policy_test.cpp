@@ -1,0 +1,102 @@
+// Verdicts, waits and pace.
+
+#include "forwarder/Policy.h"
+
+#include <gtest/gtest.h>
+
+namespace tessel {
+namespace {
+
+using std::chrono::milliseconds;
+using std::chrono::nanoseconds;
+using std::chrono::seconds;
+
+TEST(PolicyTest, EveryStatusHasItsVerdict) {
+  const std::pair<Verdict, std::vector<long>> kCases[] = {
+      {Verdict::accepted, {200, 201, 204, 299}},
+      {Verdict::later, {0, 429, 502, 503, 504}},
+      {Verdict::hold, {301, 304, 401, 403, 404, 405, 407}},
+      {Verdict::refused, {100, 400, 408, 413, 422, 500, 501, 505}},
+  };
+  CollectorAnswer answer;
+  for (const auto& [verdict, statuses] : kCases) {
+    for (const long status : statuses) {
+      answer.status = status;
+      EXPECT_EQ(verdictOn(answer), verdict) << status;
+    }
+  }
+}
+
+TEST(PolicyTest, PartialSuccessIsReadInEveryFormAndNothingElseIsOne) {
+  const struct {
+    const char* body;
+    uint64_t rejected;
+    const char* message;
+  } cases[] = {
+      {R"({"partialSuccess":{"rejectedLogRecords":"7","errorMessage":"why"}})", 7, "why"},
+      {R"({"partialSuccess":{"rejectedLogRecords":7}})", 7, ""},
+      {R"({"partialSuccess":{"errorMessage":"a warning"}})", 0, "a warning"},
+      {R"({"partialSuccess":{"rejectedLogRecords":-7}})", 0, ""},
+      {R"({"partialSuccess":{"rejectedLogRecords":{}}})", 0, ""},
+      {R"({"partialSuccess":[1]})", 0, ""},
+      {"{}", 0, ""},
+      {"", 0, ""},
+      {"7", 0, ""},
+      {"<html>", 0, ""},
+      {R"({"partialSuccess":{"rejectedLogRecords":"7")", 0, ""},
+  };
+  for (const auto& c : cases) {
+    const PartialSuccess told = partialSuccess(c.body);
+    EXPECT_EQ(told.rejected, c.rejected) << c.body;
+    EXPECT_EQ(told.message, c.message) << c.body;
+  }
+}
+
+TEST(PolicyTest, WordsOfACollectorAreFitForATerminal) {
+  CollectorAnswer answer;
+  answer.error = "no\x1b[31m route\n";
+  EXPECT_EQ(answerWords(answer), "no\\x1b[31m route ");
+  answer.status = 400;
+  answer.body = std::string(100'000, 'x') + "\x1b";
+  EXPECT_EQ(answerWords(answer), "400: " + std::string(300, 'x'));
+  answer.body.clear();
+  EXPECT_EQ(answerWords(answer), "400");
+}
+
+TEST(PolicyTest, WaitsDoubleUpToAMostAndHalfOfEachIsChance) {
+  const Backoff backoff(seconds{5}, seconds{300});
+  const struct {
+    uint32_t failures;
+    double chance;
+    std::optional<seconds> asked;
+    milliseconds wait;
+  } cases[] = {
+      {1, 0.0, {}, milliseconds{2500}},
+      {1, 0.5, {}, milliseconds{3750}},
+      {2, 0.0, {}, milliseconds{5000}},
+      {4, 0.0, {}, milliseconds{20'000}},
+      {7, 0.0, {}, milliseconds{150'000}},
+      {4'000'000'000, 0.0, {}, milliseconds{150'000}},
+      {1, 0.0, seconds{60}, milliseconds{60'000}},
+      {9, 0.5, seconds{60}, milliseconds{75'000}},
+      {1, 0.5, seconds{1}, milliseconds{3500}},
+      {1, 0.0, seconds{1'000'000'000}, milliseconds{3'600'000}},
+  };
+  for (const auto& c : cases)
+    EXPECT_EQ(backoff.wait(c.failures, c.chance, c.asked), c.wait) << c.failures;
+}
+
+TEST(PolicyTest, PaceSpreadsRecordsOverTime) {
+  Pace pace(100);
+  EXPECT_EQ(pace.waitAt(seconds{1000}), nanoseconds{0});
+  pace.sent(512, seconds{1000});
+  EXPECT_EQ(pace.waitAt(seconds{1000}), milliseconds{5120});
+  EXPECT_EQ(pace.waitAt(seconds{1005}), milliseconds{120});
+  EXPECT_EQ(pace.waitAt(seconds{2000}), nanoseconds{0});
+  Pace unlimited(0);
+  unlimited.sent(512, seconds{1000});
+  EXPECT_EQ(unlimited.waitAt(seconds{1000}), nanoseconds{0});
+}
+
+}  // namespace
+}  // namespace tessel

@@ -1,0 +1,96 @@
+#include "journal/EntryMerger.h"
+
+#include <algorithm>
+#include <tuple>
+#include <utility>
+
+namespace tessel {
+
+namespace {
+constexpr Id128 kNoId{};
+}
+
+bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
+  if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) &&
+      a.sequenceNumber != b.sequenceNumber)
+    return a.sequenceNumber < b.sequenceNumber;
+  if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
+  return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
+         std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
+}
+
+bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
+  return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
+         a.realtime == b.realtime && a.monotonic == b.monotonic && sameId(a.bootId, b.bootId) &&
+         sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) && a.contentHash != 0;
+}
+
+void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
+  Source source{std::move(stream), nullptr, number, 0};
+  if (source.next()) heap_.push_back(std::move(source));
+}
+
+bool EntryMerger::next() {
+  if (started_ && !heap_.empty()) {
+    dropDuplicates();
+    advanceFirst();
+  } else if (!started_) {
+    started_ = true;
+    for (size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
+    runnerUp_ = findRunnerUp();
+  }
+  ++current_;
+  return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+}
+
+// Most entries are followed by one of the same stream; then nothing moves.
+void EntryMerger::advanceFirst() {
+  const bool more = heap_.front().next();
+  if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
+      [[likely]]
+    return;
+  if (!more) close(0);
+  siftDown(0);
+  runnerUp_ = findRunnerUp();
+}
+
+void EntryMerger::close(size_t index) {
+  std::swap(heap_[index], heap_.back());
+  heap_.pop_back();
+}
+
+// The index of the stream that comes first but for the very first; 0: there is none.
+size_t EntryMerger::findRunnerUp() const {
+  if (heap_.size() < 2) return 0;
+  return heap_.size() > 2 && comesBefore(*heap_[2].header, *heap_[1].header) ? 2 : 1;
+}
+
+void EntryMerger::siftDown(size_t index) {
+  for (;;) {
+    size_t first = index;
+    for (size_t child = 2 * index + 1; child <= 2 * index + 2 && child < heap_.size(); ++child)
+      if (comesBefore(*heap_[child].header, *heap_[first].header)) first = child;
+    if (first == index) return;
+    std::swap(heap_[index], heap_[first]);
+    index = first;
+  }
+}
+
+// Skips the current entry, once, in all streams but its own. What equals the first of the heap can
+// only be right below it, and what is below that comes up when it is skipped.
+void EntryMerger::dropDuplicates() {
+  for (size_t child = 1; child <= 2 && child < heap_.size();) {
+    if (heap_[child].droppedAt == current_ ||
+        !sameEntry(*heap_[child].header, *heap_.front().header)) [[likely]] {
+      ++child;
+      continue;
+    }
+    heap_[child].droppedAt = current_;
+    ++duplicates_;
+    if (!heap_[child].next()) close(child);
+    siftDown(child);
+    runnerUp_ = findRunnerUp();
+  }
+}
+
+}  // namespace tessel

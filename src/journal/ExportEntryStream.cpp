@@ -1,0 +1,256 @@
+// Line by line over a window; only the heads of wanted fields are kept.
+
+#include "journal/ExportEntryStream.h"
+
+#include <algorithm>
+#include <charconv>
+
+#include "journal/EntryCursor.h"
+
+namespace tessel {
+
+namespace {
+
+// A line longer than this, beyond what is shown of one, is read in pieces.
+constexpr size_t kLongLine = kMaxFieldHead;
+
+bool isFieldName(std::string_view name) {
+  const auto valid = [](char c) {
+    return (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_';
+  };
+  return !name.empty() && name.size() <= kMaxFieldNameLength &&
+         std::all_of(name.begin(), name.end(), valid);
+}
+
+bool parseUnsigned(std::string_view text, uint64_t& out) {
+  const char* end = text.data() + text.size();
+  const auto [at, error] = std::from_chars(text.data(), end, out);
+  return error == std::errc() && at == end;
+}
+
+uint64_t littleEndian(std::string_view bytes) {
+  uint64_t value = 0;
+  for (size_t i = 8; i-- > 0;) value = (value << 8) | static_cast<uint8_t>(bytes[i]);
+  return value;
+}
+
+}  // namespace
+
+ExportEntryStream::ExportEntryStream(int fd, ExportReadResources& resources,
+                                     FieldTokenizer& tokenizer, const StopFlag& stop,
+                                     FileReport& report)
+    : resources_(resources),
+      window_(fd, stop, resources.windows),
+      tokenizer_(tokenizer),
+      stop_(stop),
+      report_(report) {}
+
+bool ExportEntryStream::next() {
+  while (!stop_.load(std::memory_order_relaxed)) {
+    if (resynchronising_ && !resynchronise()) return false;
+    startEntry();
+    switch (readEntry()) {
+      case Outcome::complete:
+        return true;
+      case Outcome::skipped:
+        break;
+      case Outcome::bad:
+        resynchronising_ = true;
+        break;
+      case Outcome::ended:
+        waitAtEntry();
+        return false;
+    }
+  }
+  return false;
+}
+
+void ExportEntryStream::startEntry() {
+  header_ = {};
+  hasRealtime_ = false;
+  dropKept();
+  entryPlace_ = window_.place();
+}
+
+size_t ExportEntryStream::keptBeyondUsual(size_t added) const {
+  const size_t memory = kept_.size() + keptFields_.size() * sizeof(KeptField) + added;
+  return memory - std::min(memory, kUsualEntry);
+}
+
+// Gives back what was kept; memory for a usual entry stays for the next.
+void ExportEntryStream::dropKept() {
+  resources_.bytesKept -= keptBeyondUsual(0);
+  kept_.clear();
+  keptFields_.clear();
+  if (kept_.capacity() > kUsualEntry) kept_.shrink_to_fit();
+  if (keptFields_.capacity() > kUsualEntry / sizeof(KeptField)) keptFields_.shrink_to_fit();
+}
+
+ExportEntryStream::Outcome ExportEntryStream::readEntry() {
+  bool empty = true;
+  for (Line line; readLine(line); empty = false) {
+    if (line.size == 0) return empty ? Outcome::skipped : finishEntry();
+    const Outcome outcome = readField(line);
+    if (outcome != Outcome::complete) return outcome;
+  }
+  return Outcome::ended;
+}
+
+ExportEntryStream::Outcome ExportEntryStream::finishEntry() {
+  if (hasRealtime_) return Outcome::complete;
+  report_.addProblem("entry without __REALTIME_TIMESTAMP", entryPlace_);
+  return Outcome::skipped;
+}
+
+// Reads up to the next newline; false where there is none yet.
+bool ExportEntryStream::readLine(Line& line) {
+  for (size_t searched = 0; searched <= kLongLine; searched = window_.bytes().size()) {
+    if (!window_.fill(searched + 1)) return false;
+    const std::string_view bytes = window_.bytes();
+    const size_t newline = bytes.find('\n', searched);
+    if (newline == std::string_view::npos) continue;
+    line = {bytes.substr(0, std::min(newline, kMaxFieldHead)), newline};
+    window_.consume(newline + 1);
+    return true;
+  }
+  return readLongLine(line);
+}
+
+// A line of any length: its beginning is set aside.
+bool ExportEntryStream::readLongLine(Line& line) {
+  resources_.longHead = window_.bytes().substr(0, kMaxFieldHead);
+  uint64_t size = 0;
+  while (!stop_.load(std::memory_order_relaxed) && window_.fill(1)) {
+    const std::string_view bytes = window_.bytes();
+    const size_t newline = bytes.find('\n');
+    const size_t length = std::min(newline, bytes.size());
+    size += length;
+    window_.consume(newline == std::string_view::npos ? length : length + 1);
+    if (newline == std::string_view::npos) continue;
+    line = {resources_.longHead, size};
+    return true;
+  }
+  return false;
+}
+
+ExportEntryStream::Outcome ExportEntryStream::readField(const Line& line) {
+  const size_t equals = line.head.find('=');
+  if (equals != std::string_view::npos) return takeField(equals, line.head, line.size);
+  if (line.size == line.head.size() && isFieldName(line.head)) return readBinaryField(line.head);
+  return bad("line that is no field");
+}
+
+ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view name) {
+  std::string head(name);
+  head += '=';
+  const uint64_t lengthPlace = window_.place();
+  if (!window_.fill(8)) return Outcome::ended;
+  const uint64_t length = littleEndian(window_.bytes());
+  if (length > kMaxValueLength) return bad("value longer than any");
+  window_.consume(8);
+  const auto shown = static_cast<size_t>(std::min<uint64_t>(length, kMaxFieldValueLength + 1));
+  if (!window_.fill(shown)) return Outcome::ended;
+  head.append(window_.bytes().substr(0, shown));
+  if (!window_.skip(length) || !window_.fill(1)) return Outcome::ended;
+  if (window_.bytes().front() != '\n') {
+    goBackWithin(lengthPlace);
+    return bad("value of another length than stated");
+  }
+  window_.consume(1);
+  const size_t nameLength = head.find('=');
+  return takeField(nameLength, head, nameLength + 1 + length);
+}
+
+// Where a length is wrong, the empty line to go on after may lie within it. A file of nothing but
+// wrong lengths must still be read in time of its size.
+void ExportEntryStream::goBackWithin(uint64_t place) {
+  constexpr uint64_t kTimesOver = 8;
+  const uint64_t distance = window_.place() - place;
+  if (wentBack_ + distance > kTimesOver * window_.place()) return;
+  wentBack_ += distance;
+  window_.rewind(place);
+}
+
+ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::string_view head,
+                                                        uint64_t size) {
+  const std::string_view name = head.substr(0, nameLength);
+  if (name.starts_with("__") || name == "_BOOT_ID") {
+    return takeAddress(name, head.substr(nameLength + 1));
+  }
+  if (!tokenizer_.wants(name)) return Outcome::complete;
+  if (keptFields_.size() == kMaxFieldsKept || kept_.size() + head.size() > kMaxBytesKept) {
+    return bad("entry with too many fields");
+  }
+  const size_t more = keptBeyondUsual(head.size() + sizeof(KeptField)) - keptBeyondUsual(0);
+  if (resources_.bytesKept + more > kMaxBytesKeptByAll) {
+    return bad("entry too large beside those of other files");
+  }
+  resources_.bytesKept += more;
+  const uint64_t valueSize = size - nameLength - 1;
+  keptFields_.push_back({static_cast<uint32_t>(kept_.size()), static_cast<uint32_t>(nameLength),
+                         static_cast<uint32_t>(head.size()),
+                         static_cast<uint32_t>(std::min<uint64_t>(valueSize, UINT32_MAX))});
+  kept_ += head;
+  return Outcome::complete;
+}
+
+// Fields that say where an entry stands. The cursor comes first in a file, the others have the
+// last word.
+ExportEntryStream::Outcome ExportEntryStream::takeAddress(std::string_view name,
+                                                          std::string_view value) {
+  if (name == "__CURSOR") {
+    if (const auto place = parseCursor(value)) header_ = *place;
+  } else if (name == "__REALTIME_TIMESTAMP") {
+    if (hasRealtime_) return bad("two entries without an empty line between");
+    if (!parseUnsigned(value, header_.realtime)) return bad("invalid __REALTIME_TIMESTAMP");
+    hasRealtime_ = true;
+  } else if (name == "__MONOTONIC_TIMESTAMP") {
+    if (!parseUnsigned(value, header_.monotonic)) return bad("invalid __MONOTONIC_TIMESTAMP");
+  } else if (name == "__SEQNUM") {
+    if (!parseUnsigned(value, header_.sequenceNumber)) return bad("invalid __SEQNUM");
+  } else if (const auto id = parseId128(value)) {
+    if (name == "__SEQNUM_ID") header_.sequenceId = *id;
+    if (name == "_BOOT_ID") header_.bootId = *id;
+  }
+  return Outcome::complete;
+}
+
+ExportEntryStream::Outcome ExportEntryStream::bad(std::string_view reason) {
+  report_.addProblem(reason, entryPlace_);
+  return Outcome::bad;
+}
+
+// Passes over what is left up to the next empty line; false where it is not there yet.
+bool ExportEntryStream::resynchronise() {
+  for (Line line; readLine(line);) {
+    if (line.size == 0) {
+      resynchronising_ = false;
+      return true;
+    }
+  }
+  return false;
+}
+
+// What is there of the last entry is looked at again by the next call, as far as one can go back.
+void ExportEntryStream::waitAtEntry() {
+  if (!window_.error().empty()) report_.addProblem("read error: " + window_.error(), entryPlace_);
+  const bool stopped = stop_.load(std::memory_order_relaxed);
+  if (stopped || (window_.place() == entryPlace_ && window_.bytes().empty())) return;
+  if (incompletePlace_ != entryPlace_) report_.addProblem("incomplete last entry", entryPlace_);
+  incompletePlace_ = entryPlace_;
+  window_.rewind(entryPlace_);
+}
+
+Entry ExportEntryStream::entry() {
+  tokenizer_.beginEntry();
+  resources_.tokens.clear();
+  for (const KeptField& field : keptFields_) {
+    const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);
+    const FieldToken token = tokenizer_.tokenFor(head.substr(0, field.nameLength),
+                                                 head.substr(field.nameLength + 1), field.size);
+    if (token != kNoToken) resources_.tokens.push_back(token);
+  }
+  return {header_, resources_.tokens};
+}
+
+}  // namespace tessel

@@ -1,0 +1,196 @@
+#include "journal/ExportFile.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <chrono>
+#include <ctime>
+#include <filesystem>
+#include <fstream>
+#include <system_error>
+
+#include "journal/EntryCursor.h"
+#include "os/UniqueFd.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr std::string_view kEntryStart = "\n\n__CURSOR=";
+constexpr std::string_view kEntryEnd = "\n\n";
+// How much of the end of a file is searched for the last entry, at first and at most.
+constexpr off_t kFirstLook = off_t{64} * 1024;
+constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
+
+uint64_t microsecondsOf(clockid_t clock) {
+  timespec now{};
+  ::clock_gettime(clock, &now);
+  return static_cast<uint64_t>(now.tv_sec) * 1'000'000 + static_cast<uint64_t>(now.tv_nsec) / 1000;
+}
+
+std::string firstLineOf(const char* path) {
+  std::string line;
+  std::ifstream file(path);
+  std::getline(file, line);
+  return line;
+}
+
+PlatformError failure(const std::string& path, const std::string& doing, int error) {
+  return {"Cannot " + doing + " " + path + ": " + std::generic_category().message(error)};
+}
+
+uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
+  uint64_t all = 0;
+  for (const RecordedField& field : fields) {
+    uint64_t hash = 0xcbf29ce484222325u;
+    for (const char c : field.name + "=" + field.value) {
+      hash = (hash ^ static_cast<uint8_t>(c)) * 0x100000001b3u;
+    }
+    all ^= hash;
+  }
+  return all;
+}
+
+void appendField(std::string& out, std::string_view name, std::string_view value) {
+  const bool text = std::none_of(value.begin(), value.end(),
+                                 [](char c) { return static_cast<uint8_t>(c) < ' ' && c != '\t'; });
+  out += name;
+  if (text) {
+    out += '=';
+  } else {
+    out += '\n';
+    for (int shift = 0; shift < 64; shift += 8) {
+      out += static_cast<char>((uint64_t{value.size()} >> shift) & 0xff);
+    }
+  }
+  out += value;
+  out += '\n';
+}
+
+std::string readAt(int fd, off_t offset, size_t count) {
+  std::string text(count, '\0');
+  const ssize_t got = ::pread(fd, text.data(), count, offset);
+  text.resize(got > 0 ? static_cast<size_t>(got) : 0);
+  return text;
+}
+
+Id128 randomId() {
+  Id128 id{};
+  // Cannot fall short for so few bytes.
+  static_cast<void>(::getrandom(id.data(), id.size(), 0));
+  return id;
+}
+
+// The header of the last entry in `tail`, which begins an entry or somewhere in one.
+std::optional<EntryHeader> lastEntryIn(std::string_view tail) {
+  // Values may hold what looks like the start of an entry.
+  for (size_t at = tail.rfind(kEntryStart); at != std::string_view::npos;
+       at = at == 0 ? std::string_view::npos : tail.rfind(kEntryStart, at - 1)) {
+    std::string_view cursor = tail.substr(at + kEntryStart.size());
+    cursor = cursor.substr(0, cursor.find('\n'));
+    if (const auto header = parseCursor(cursor)) return header;
+  }
+  return std::nullopt;
+}
+
+// The header of the last entry in the file; nothing where there is none that has a cursor.
+std::optional<EntryHeader> lastEntry(int fd, off_t size) {
+  for (off_t look = kFirstLook;; look *= 4) {
+    const off_t from = std::max<off_t>(0, size - look);
+    std::string tail = readAt(fd, from, static_cast<size_t>(size - from));
+    if (from == 0) tail.insert(0, kEntryEnd);
+    if (const auto header = lastEntryIn(tail)) return header;
+    if (from == 0 || look > kLastLook) return std::nullopt;
+  }
+}
+
+bool writeAll(int fd, std::string_view text) {
+  while (!text.empty()) {
+    const ssize_t written = ::write(fd, text.data(), text.size());
+    if (written < 0 && errno == EINTR) continue;
+    if (written < 0) return false;
+    text.remove_prefix(static_cast<size_t>(written));
+  }
+  return true;
+}
+
+std::optional<PlatformError> appendLocked(int fd, const std::string& path,
+                                          const RecordOrigin& origin,
+                                          const std::vector<RecordedField>& fields) {
+  struct stat status {};
+  if (::fstat(fd, &status) != 0) return failure(path, "look at", errno);
+  EntryHeader header;
+  // All entries of one file count in one sequence.
+  const std::optional<EntryHeader> last = lastEntry(fd, status.st_size);
+  header.sequenceId = last ? last->sequenceId : randomId();
+  header.sequenceNumber = last ? last->sequenceNumber + 1 : 1;
+  header.bootId = origin.boot;
+  header.monotonic = origin.monotonic;
+  header.realtime = origin.realtime;
+  header.contentHash = contentHashOf(fields);
+  std::string text = exportText(header, origin, fields);
+  // A writer that was killed may have left half an entry; end it, so that ours is not part of it.
+  if (status.st_size > 0 && readAt(fd, std::max<off_t>(0, status.st_size - 2), 2) != kEntryEnd) {
+    text.insert(0, kEntryEnd);
+  }
+  if (writeAll(fd, text)) return std::nullopt;
+  const int error = errno;
+  if (::ftruncate(fd, status.st_size) != 0)
+    return failure(path, "take back half an entry in", errno);
+  return failure(path, "write to", error);
+}
+
+}  // namespace
+
+RecordOrigin currentOrigin() {
+  RecordOrigin origin;
+  origin.realtime = microsecondsOf(CLOCK_REALTIME);
+  origin.monotonic = microsecondsOf(CLOCK_MONOTONIC);
+  origin.boot = parseId128(firstLineOf("/proc/sys/kernel/random/boot_id")).value_or(Id128{});
+  std::error_code error;
+  const auto image = std::filesystem::read_symlink("/proc/self/exe", error);
+  if (!error) origin.imagePath = image.string();
+  origin.processName = firstLineOf("/proc/self/comm");
+  origin.process = std::to_string(::getpid());
+  return origin;
+}
+
+std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
+                       const std::vector<RecordedField>& fields) {
+  std::string text;
+  appendField(text, "__CURSOR", cursorOf(header));
+  appendField(text, "__REALTIME_TIMESTAMP", std::to_string(header.realtime));
+  appendField(text, "__MONOTONIC_TIMESTAMP", std::to_string(header.monotonic));
+  appendField(text, "_BOOT_ID", textOf(header.bootId));
+  for (const RecordedField& field : fields) appendField(text, field.name, field.value);
+  if (origin.imagePath) appendField(text, "_EXE", *origin.imagePath);
+  if (origin.processName) appendField(text, "_COMM", *origin.processName);
+  if (origin.process) appendField(text, "_PID", *origin.process);
+  return text + '\n';
+}
+
+std::optional<PlatformError> appendToExportFile(const std::string& directory,
+                                                const RecordOrigin& origin,
+                                                const std::vector<RecordedField>& fields) {
+  std::string path = directory;
+  if (!directory.ends_with(".export")) {
+    std::error_code error;
+    std::filesystem::create_directories(directory, error);
+    if (error) return PlatformError{"Cannot make " + directory + ": " + error.message()};
+    path += "/tessel.export";
+  }
+  const UniqueFd file(::open(path.c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+  if (!file.valid()) return failure(path, "open", errno);
+  while (::flock(file.get(), LOCK_EX) != 0) {
+    if (errno != EINTR) return failure(path, "lock", errno);
+  }
+  return appendLocked(file.get(), path, origin, fields);
+}
+
+}  // namespace tessel

@@ -1,0 +1,47 @@
+// Appending entries to a file in the Journal Export Format, where no journal daemon runs.
+//
+// Any number of processes may append to one file: each entry is written whole, under a lock of the
+// file. What the daemon would have added comes from the caller.
+
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "journal/EntryStream.h"
+#include "objects/TesselSupportObjectExtractor.h"
+
+namespace tessel {
+
+struct RecordedField {
+  std::string name;
+  std::string value;
+};
+
+// What the journal daemon adds to an entry; what is absent is left out of it.
+struct RecordOrigin {
+  uint64_t realtime = 0;   // microseconds since 1970
+  uint64_t monotonic = 0;  // microseconds since boot
+  Id128 boot{};
+  std::optional<std::string> imagePath;
+  std::optional<std::string> processName;
+  std::optional<std::string> process;
+};
+
+// The calling process, now.
+RecordOrigin currentOrigin();
+
+// The entry with its address and origin in the format, the empty line at its end included.
+std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
+                       const std::vector<RecordedField>& fields);
+
+// Appends one entry to `<directory>/tessel.export`, making both where they are not there, or to
+// `directory` itself where it names an `.export` file. An error names the path and the reason, and
+// nothing was appended.
+std::optional<PlatformError> appendToExportFile(const std::string& directory,
+                                                const RecordOrigin& origin,
+                                                const std::vector<RecordedField>& fields);
+
+}  // namespace tessel

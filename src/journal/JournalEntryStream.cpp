@@ -1,0 +1,212 @@
+#include "journal/JournalEntryStream.h"
+
+#include <algorithm>
+#include <string_view>
+#include <utility>
+
+namespace tessel {
+
+using namespace journal_format;
+
+namespace {
+// Answered in place of a token where a data object is not what it should be. No token has this
+// value.
+constexpr FieldToken kDamaged = UINT32_MAX;
+}  // namespace
+
+JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header,
+                                       uint32_t number, const Context& context)
+    : file_(std::move(fd), size, header, context.resources.windows),
+      number_(number),
+      context_(context),
+      chain_(file_, header.entryArray, header.entryCount),
+      marked_(
+          MarkedEntries::of(file_, context.marks, context.resources.entryListsLeft, context.stop)),
+      searchedTo_(header.headerSize),
+      firstFresh_(header.headerSize) {
+  entry_.sequenceId = header.sequenceId;
+}
+
+bool JournalEntryStream::next() {
+  while (!context_.stop.load(std::memory_order_relaxed)) {
+    const uint64_t offset = search_ || pending_ != 0 ? nextFound() : nextListed();
+    if (offset == 0) {
+      // An end that comes with the stop is none of the file's.
+      if (!context_.stop.load(std::memory_order_relaxed)) finish();
+      return false;
+    }
+    if (take(offset)) return true;
+  }
+  return false;
+}
+
+// Where the chain has the next entry. Where it has a gap before that, the search comes first.
+uint64_t JournalEntryStream::nextListed() {
+  if (finished_) return 0;
+  const uint64_t offset = chain_.next();
+  finished_ = offset == 0;
+  if (!chain_.gapBefore()) [[likely]]
+    return offset;
+  searchUpTo(offset);
+  return nextFound();
+}
+
+// Where the search that is under way has the next entry, and then the chain.
+uint64_t JournalEntryStream::nextFound() {
+  if (search_) {
+    if (const auto found = search_->next()) return *found;
+    endSearch();
+  }
+  if (pending_ != 0) return std::exchange(pending_, 0);
+  return nextListed();
+}
+
+// Makes the entry at `offset` the current one; false where it is none, and then what lies around it
+// is searched, up to the next that the chain lists.
+bool JournalEntryStream::take(uint64_t offset) {
+  const uint64_t size = file_.readEntry(offset, searchedTo_, entry_);
+  if (size == 0) {
+    context_.report.addProblem("entry damaged", offset);
+    const uint64_t next = chain_.next();
+    finished_ = next == 0;
+    searchUpTo(next);
+    return false;
+  }
+  entryOffset_ = offset;
+  entrySize_ = size;
+  firstFresh_ = searchedTo_;
+  searchedTo_ = alignUp(offset + size);
+  ++delivered_;
+  // What was added since the header was read may be in no list yet.
+  entryMarked_ = marked_ == nullptr || delivered_ > file_.header().entryCount || isMarked(offset);
+  return true;
+}
+
+bool JournalEntryStream::isMarked(uint64_t offset) {
+  if (!marked_->has(offset)) [[likely]]
+    return false;
+  if (marked_->missed()) context_.report.addProblem("list of entries damaged", offset);
+  if (!marked_->usable()) marked_.reset();
+  return true;
+}
+
+// Searches what lies before `listed`, the next entry of the chain; 0: the chain has ended.
+void JournalEntryStream::searchUpTo(uint64_t listed) {
+  if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
+  marked_.reset();  // what is found may stand in no list
+  pending_ = listed;
+  const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
+  search_.emplace(file_, std::min(searchedTo_, end), end, context_.stop);
+}
+
+void JournalEntryStream::endSearch() {
+  if (search_->damagedPlaces() != 0)
+    context_.report.addProblem("objects damaged", search_->firstDamage(), search_->damagedPlaces());
+  search_.reset();
+  searchedTo_ = std::max(searchedTo_, pending_);
+}
+
+void JournalEntryStream::finish() {
+  if (std::exchange(reported_, true)) return;
+  const uint64_t expected = file_.header().entryCount;
+  if (marked_ && marked_->awaitsMore() && delivered_ <= expected)
+    context_.report.addProblem("list of entries damaged", file_.objectsEnd());
+  // The daemon cuts off what it has not used of a file when it closes it; that costs nothing.
+  if (file_.file().failed() && (expected > delivered_ || !context_.report.problems.empty()))
+    context_.report.addProblem("cut short or not readable", file_.file().size());
+  if (expected > delivered_)
+    context_.report.addProblem("entries missing", file_.objectsEnd(), expected - delivered_);
+}
+
+Entry JournalEntryStream::entry() {
+  if (!entryMarked_) return {entry_, {}};
+  context_.tokenizer.beginEntry();
+  const size_t count = collectTokens();
+  return {entry_, std::span(context_.resources.tokens).first(count)};
+}
+
+// Answers how many there are.
+size_t JournalEntryStream::collectTokens() {
+  const size_t all = file_.itemCount(entrySize_);
+  const size_t count = std::min(all, JournalFile::kMaxItems);
+  if (all > count) context_.report.addProblem("entry with too many fields", entryOffset_);
+  const uint64_t offset = entryOffset_ + kEntryItemsAt;
+  const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), firstFresh_);
+  if (items == nullptr) {
+    context_.report.addProblem("entry damaged", entryOffset_);
+    return 0;
+  }
+  return file_.header().compact() ? tokensOf<uint32_t>(items, count)
+                                  : tokensOf<uint64_t>(items, count);
+}
+
+template <typename Item>
+size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
+  context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
+  const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
+  const size_t step = file_.itemSize();
+  FieldToken* const tokens = context_.resources.tokens.data();
+  FieldToken* kept = tokens;
+  for (size_t i = 0; i < count; ++i) {
+    const uint64_t offset = load<Item>(items + i * step);
+    FieldToken token = offset <= TokenCache::kMaxOffset ? cache.find(offset) : TokenCache::kUnknown;
+    if (token == TokenCache::kUnknown) [[unlikely]] {
+      if (context_.stop.load(std::memory_order_relaxed)) break;
+      token = newTokenAt(offset);
+    }
+    *kept = token;
+    kept += token != kNoToken;
+  }
+  return static_cast<size_t>(kept - tokens);
+}
+
+// Looks at a data object. What only this entry refers to is not remembered, unless looking again
+// would be dear, nor is what is none: it may lie across one that is.
+FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
+  DataObject data;
+  if (!file_.readData(offset, context_.resources.data, data)) {
+    context_.report.addProblem("data object damaged", offset);
+    return kNoToken;
+  }
+  FieldToken token =
+      data.compression == 0 ? textToken(data.head, data.payloadSize) : decompressToken(data);
+  if (token == kDamaged) {
+    context_.report.addProblem("data object damaged", offset);
+    token = kNoToken;
+  }
+  if (offset < firstFresh_ || data.entryCount != 1 || data.compression != 0)
+    TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, token);
+  return token;
+}
+
+FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head, uint64_t size) {
+  const std::string_view text(reinterpret_cast<const char*>(head.data()), head.size());
+  const size_t nameLength = text.substr(0, kMaxFieldNameLength + 1).find('=');
+  if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
+  return context_.tokenizer.tokenFor(text.substr(0, nameLength), text.substr(nameLength + 1),
+                                     size - nameLength - 1);
+}
+
+// Decompresses the name first, and the value only where the name is wanted.
+FieldToken JournalEntryStream::decompressToken(const DataObject& data) {
+  const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> target) {
+    const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);
+    const auto length = static_cast<size_t>(std::min<uint64_t>(left, target.size()));
+    return file_.file().read(data.payloadOffset + position, target.first(length));
+  };
+  Decompressor& decompressor = context_.resources.decompressor;
+  const std::span<uint8_t> text = context_.resources.text;
+  const auto name =
+      decompressor.decompress(data.compression, source, text.first(kMaxFieldNameLength + 1));
+  if (!name) return kDamaged;
+  const std::string_view start(reinterpret_cast<const char*>(text.data()), name->produced);
+  const size_t nameLength = start.find('=');
+  if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
+  if (!context_.tokenizer.wants(start.substr(0, nameLength))) return kNoToken;
+  const auto whole = decompressor.decompress(data.compression, source, text);
+  if (!whole) return kDamaged;
+  return textToken(text.first(whole->produced),
+                   whole->complete ? whole->produced : text.size() + 1);
+}
+
+}  // namespace tessel

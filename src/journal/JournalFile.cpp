@@ -1,0 +1,161 @@
+#include "journal/JournalFile.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <system_error>
+#include <utility>
+
+namespace tessel {
+
+using namespace journal_format;
+
+namespace {
+
+uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
+  switch (type) {
+    case kData:
+      return dataHeaderSize + 1;
+    case kField:
+      return kFieldHeaderSize + 1;
+    case kEntry:
+      return kEntryItemsAt + kCompactEntryItemSize;
+    case kEntryArray:
+      return kArrayItemsAt + kCompactEntryItemSize;
+    case kTag:
+      return kTagSize;
+    default:
+      return kObjectHeaderSize + 1;
+  }
+}
+
+Id128 loadId(const uint8_t* at) {
+  Id128 id;
+  std::memcpy(id.data(), at, id.size());
+  return id;
+}
+
+// Where the objects end: with the arena, or with the file where the arena claims more or grows. A
+// header of a damaged size is followed by objects all the same.
+uint64_t endOfObjects(JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
+  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
+      header.headerSize > std::min(fileSize, kMaxHeaderSize)) {
+    header.headerSize = kMinHeaderSize;
+    return fileSize;
+  }
+  if (header.beingWritten() || arenaSize > fileSize - header.headerSize) return fileSize;
+  return header.headerSize + arenaSize;
+}
+
+}  // namespace
+
+std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint8_t> bytes,
+                                                            uint64_t fileSize) {
+  if (bytes.empty()) return "it is empty";
+  if (bytes.size() < kMinHeaderSize) return "too short for a journal";
+  const uint8_t* at = bytes.data();
+  if (std::memcmp(at, kSignature, 8) != 0) return "not a journal file";
+  JournalHeader header;
+  header.incompatibleFlags = load<uint32_t>(at + kIncompatibleFlagsAt);
+  header.state = at[kStateAt];
+  header.sequenceId = loadId(at + kSequenceIdAt);
+  header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
+  header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
+  // While a file is written, what lies behind its last object is not yet an object.
+  const auto lastObject = load<uint64_t>(at + kTailObjectAt);
+  const bool growing = header.beingWritten() && aligned(lastObject) &&
+                       lastObject >= header.headerSize && lastObject < header.objectsEnd;
+  header.lastObject = growing ? lastObject : UINT64_MAX;
+  header.entryCount = std::min(load<uint64_t>(at + kEntryCountAt), fileSize / kEntryItemsAt);
+  header.entryArray = load<uint64_t>(at + kEntryArrayAt);
+  header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
+  header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
+  if (bytes.size() >= kHeaderRead && header.headerSize >= kHeaderRead) {
+    header.fieldTable = load<uint64_t>(at + kFieldTableAt);
+    header.fieldTableSize = load<uint64_t>(at + kFieldTableSizeAt);
+    header.fieldCount = load<uint64_t>(at + kFieldCountAt);
+  }
+  return header;
+}
+
+// The size is asked for last, so that it covers all that the header counts.
+std::variant<JournalBeginning, std::string> readJournalHeader(int fd) {
+  std::array<uint8_t, kHeaderRead> bytes;
+  const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
+  struct stat status {};
+  if (got < 0 || ::fstat(fd, &status) != 0) return std::generic_category().message(errno);
+  const auto fileSize = static_cast<uint64_t>(status.st_size);
+  auto parsed = parseJournalHeader(std::span(bytes).first(static_cast<size_t>(got)), fileSize);
+  if (auto* reason = std::get_if<std::string>(&parsed)) return std::move(*reason);
+  return JournalBeginning{std::get<JournalHeader>(parsed), fileSize};
+}
+
+JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header,
+                         WindowBudget& budget)
+    : header_(header),
+      file_(std::move(fd), size, budget),
+      itemShift_(std::countr_zero(header.compact() ? kCompactEntryItemSize : kEntryItemSize)),
+      dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
+
+std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> bytes,
+                                                      uint64_t room) const {
+  const uint64_t first = load<uint64_t>(bytes.data());
+  ObjectHeader object{static_cast<uint8_t>(first & 0xff), static_cast<uint8_t>(first >> 8 & 0xff),
+                      load<uint64_t>(bytes.data() + kObjectSizeAt)};
+  // Six reserved bytes follow type and flags; only data has flags.
+  if (first >> 16 != 0 || object.type == kUnused || object.type > kTag) return std::nullopt;
+  if (object.flags != 0 && (object.type != kData || (object.flags & ~kKnownDataFlags) != 0))
+    return std::nullopt;
+  if (object.size < leastSize(object.type, dataHeaderSize_) || object.size > room)
+    return std::nullopt;
+  return object;
+}
+
+uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
+  if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
+  const uint64_t room = objectsEnd() - offset;  // reading may find the file cut off before it
+  const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
+  // An entry has no flags.
+  if (at == nullptr || load<uint64_t>(at) != kEntry) return 0;
+  const auto size = load<uint64_t>(at + kObjectSizeAt);
+  if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
+  entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
+  entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
+  entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
+  entry.bootId = loadId(at + kEntryBootAt);
+  entry.contentHash = load<uint64_t>(at + kEntryHashAt);
+  if (entry.sequenceNumber == 0 || entry.sequenceNumber > kMaxSequenceNumber ||
+      entry.realtime == 0 || entry.realtime >= kMaxTime || entry.monotonic >= kMaxTime)
+    return 0;
+  return size;
+}
+
+bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch,
+                           DataObject& data) {
+  if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return false;
+  const uint64_t room = objectsEnd() - offset;
+  const uint64_t wanted = std::min(room, dataHeaderSize_ + kMaxFieldHead);
+  std::span<const uint8_t> bytes = file_.restOfWindow(offset);
+  if (bytes.size() < wanted && (bytes.size() < kObjectHeaderSize ||
+                                bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
+    bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(wanted)})};
+  }
+  if (bytes.size() <= dataHeaderSize_) return false;
+  const auto first = load<uint64_t>(bytes.data());
+  data.compression = static_cast<uint8_t>(first >> 8);
+  // Type and flags, then six reserved bytes.
+  if ((first & ~(uint64_t{kKnownDataFlags} << 8)) != kData) return false;
+  const auto size = load<uint64_t>(bytes.data() + kObjectSizeAt);
+  const uint64_t shown = std::min(size, wanted);
+  if (size <= dataHeaderSize_ || size > room || shown > bytes.size()) return false;
+  data.entryCount = load<uint64_t>(bytes.data() + kDataEntryCountAt);
+  data.payloadOffset = offset + dataHeaderSize_;
+  data.payloadSize = size - dataHeaderSize_;
+  data.head = bytes.first(static_cast<size_t>(shown)).subspan(dataHeaderSize_);
+  return true;
+}
+
+}  // namespace tessel

@@ -1,0 +1,99 @@
+#include "journal/LossTokenizer.h"
+
+#include <algorithm>
+#include <charconv>
+#include <iterator>
+
+namespace tessel {
+
+namespace {
+
+constexpr std::string_view kMessageId = "MESSAGE_ID";
+constexpr std::string_view kCount = "N_DROPPED";
+constexpr std::string_view kUnit = "OBJECT_SYSTEMD_UNIT";
+constexpr std::string_view kLossMessage = "a596d6fe7bfa4994828e72309e95d61e";
+
+// The message, then the counts, each by its number, then the units.
+constexpr FieldToken kLossToken = kFirstReservedToken;
+constexpr FieldToken kFirstCount = kFirstReservedToken + 1;
+constexpr FieldToken kFirstUnit = kFirstReservedToken + 0x40000000;
+
+bool isOurs(FieldToken token) { return token >= kFirstReservedToken; }
+
+// A count beyond what a token can say is taken for the greatest that it can.
+FieldToken countToken(std::string_view value) {
+  uint64_t number = 0;
+  const auto [end, error] = std::from_chars(value.data(), value.data() + value.size(), number);
+  if (error != std::errc()) return kNoToken;
+  return kFirstCount +
+         static_cast<FieldToken>(std::min<uint64_t>(number, kFirstUnit - 1 - kFirstCount));
+}
+
+}  // namespace
+
+std::vector<EntryMark> LossTokenizer::marks() const {
+  std::vector<EntryMark> marks = user_.marks();
+  if (!marks.empty()) marks.push_back({kMessageId, kLossMessage});
+  return marks;
+}
+
+bool LossTokenizer::wants(std::string_view fieldName) const {
+  return user_.wants(fieldName) || fieldName == kMessageId || fieldName == kCount ||
+         fieldName == kUnit;
+}
+
+FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view value, uint64_t size) {
+  if (field == kMessageId && value == kLossMessage) {
+    met_ = true;
+    return kLossToken;
+  }
+  if (field == kCount) return countToken(value);
+  if (field == kUnit) return unitToken(value);
+  return user_.tokenFor(field, value, size);
+}
+
+FieldToken LossTokenizer::unitToken(std::string_view name) {
+  if (name.empty() || name.size() > kMaxUnitLength) return kNoToken;
+  if (const auto known = unitTokens_.find(name); known != unitTokens_.end()) return known->second;
+  if (units_.size() > kMaxUnits) return kNoToken;
+  const FieldToken token = kFirstUnit + static_cast<FieldToken>(units_.size());
+  units_.push_back({std::string(name), 0});
+  unitTokens_.emplace(name, token);
+  return token;
+}
+
+std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
+  if (!met_) return tokens;
+  FieldToken highest = 0;
+  for (const FieldToken token : tokens) highest = std::max(highest, token);
+  if (!isOurs(highest)) return tokens;
+  count(tokens);
+  theirs_.assign(tokens.begin(), tokens.end());
+  std::erase_if(theirs_, isOurs);
+  return theirs_;
+}
+
+void LossTokenizer::count(std::span<const FieldToken> tokens) {
+  bool loss = false;
+  uint64_t number = 0;
+  size_t unit = 0;
+  for (const FieldToken token : tokens) {
+    if (token == kLossToken) {
+      loss = true;
+    } else if (token >= kFirstUnit) {
+      unit = token - kFirstUnit;
+    } else if (token >= kFirstCount) {
+      number = token - kFirstCount;
+    }
+  }
+  if (loss) units_[unit].count += number;
+}
+
+std::vector<DroppedEntries> LossTokenizer::dropped() const {
+  std::vector<DroppedEntries> dropped;
+  std::copy_if(units_.begin(), units_.end(), std::back_inserter(dropped),
+               [](const DroppedEntries& one) { return one.count != 0; });
+  return dropped;
+}
+
+}  // namespace tessel

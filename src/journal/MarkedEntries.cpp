@@ -1,0 +1,204 @@
+#include "journal/MarkedEntries.h"
+
+#include <algorithm>
+#include <array>
+#include <string_view>
+#include <utility>
+
+namespace tessel {
+
+using namespace journal_format;
+
+namespace {
+
+// A file with more fields, or more values of a marked one, is read without its index.
+constexpr uint64_t kMaxFields = 4096;
+constexpr uint64_t kMaxFieldTable = uint64_t{1} << 20;  // bytes
+constexpr size_t kMaxValues = 1024;
+constexpr size_t kMaxLists = 16;
+constexpr size_t kListPiece = 1024;  // bytes that are read of a list at once
+
+std::string_view textAt(const uint8_t* at, size_t size) {
+  return {reinterpret_cast<const char*>(at), size};
+}
+
+}  // namespace
+
+// Follows the index from the table of fields to the lists. Every step answers false where the index
+// does not hold.
+class MarkedEntries::IndexReader {
+ public:
+  IndexReader(JournalFile& file, const StopFlag& stop) : file_(file), stop_(stop) {}
+
+  bool read(std::span<const EntryMark> marks) {
+    const JournalHeader& header = file_.header();
+    if (marks.empty() || header.beingWritten() || header.fieldCount > kMaxFields) return false;
+    for (const EntryMark& mark : marks) {
+      fields_.push_back({mark.field});
+      for (const std::string_view name : mark.companions) fields_.push_back({name});
+    }
+    return findFields() && std::all_of(marks.begin(), marks.end(),
+                                       [this](const EntryMark& mark) { return take(mark); });
+  }
+  std::vector<List> lists() { return std::move(lists_); }
+
+ private:
+  struct Field {
+    std::string_view name;
+    uint64_t firstValue = 0;  // 0: the file has no such field
+  };
+
+  bool findFields();
+  bool followBucket(uint64_t offset);
+  bool take(const EntryMark& mark);
+  bool takeValues(std::string_view name, std::string_view value, bool listed, uint64_t& entries);
+  bool addList(const uint8_t* data, uint64_t entries);
+  bool stopped() const { return stop_.load(std::memory_order_relaxed); }
+  bool readObject(uint64_t offset, ObjectType type, size_t least, std::span<uint8_t> target);
+
+  JournalFile& file_;
+  const StopFlag& stop_;
+  std::vector<Field> fields_;  // that are looked for
+  uint64_t found_ = 0;         // fields of all names
+  std::vector<List> lists_;
+};
+
+// Reads the beginning of an object of one type, `least` bytes or more of it.
+bool MarkedEntries::IndexReader::readObject(uint64_t offset, ObjectType type, size_t least,
+                                            std::span<uint8_t> target) {
+  if (stopped() || !file_.mayHoldObject(offset, least)) return false;
+  const uint64_t room = file_.objectsEnd() - offset;
+  const size_t got = file_.file().read(
+      offset, target.first(static_cast<size_t>(std::min<uint64_t>(room, target.size()))));
+  if (got < least) return false;
+  const auto object = file_.objectHeader(target.first(got), room);
+  return object && object->type == type;
+}
+
+bool MarkedEntries::IndexReader::findFields() {
+  const JournalHeader& header = file_.header();
+  std::array<uint8_t, 4096> buckets;
+  if (header.fieldTableSize > kMaxFieldTable || header.fieldTableSize % kBucketSize != 0 ||
+      header.fieldTable < kObjectHeaderSize ||
+      !readObject(header.fieldTable - kObjectHeaderSize, kFieldHashTable, kObjectHeaderSize,
+                  std::span(buckets).first(kObjectHeaderSize)) ||
+      load<uint64_t>(buckets.data() + kObjectSizeAt) != kObjectHeaderSize + header.fieldTableSize)
+    return false;
+  for (uint64_t at = 0; at < header.fieldTableSize; at += buckets.size()) {
+    const size_t size =
+        static_cast<size_t>(std::min<uint64_t>(buckets.size(), header.fieldTableSize - at));
+    if (file_.file().read(header.fieldTable + at, std::span(buckets).first(size)) != size)
+      return false;
+    for (size_t i = 0; i < size; i += kBucketSize)
+      if (!followBucket(load<uint64_t>(buckets.data() + i))) return false;
+  }
+  return found_ == header.fieldCount;
+}
+
+// Looks at the fields of one bucket, of which the first is at `offset`; 0: it is empty.
+bool MarkedEntries::IndexReader::followBucket(uint64_t offset) {
+  std::array<uint8_t, kFieldHeaderSize + kMaxFieldNameLength> bytes;
+  while (offset != 0) {
+    if (++found_ > file_.header().fieldCount ||
+        !readObject(offset, kField, kFieldHeaderSize + 1, bytes))
+      return false;
+    const uint64_t length = load<uint64_t>(bytes.data() + kObjectSizeAt) - kFieldHeaderSize;
+    const std::string_view name =
+        textAt(bytes.data() + kFieldHeaderSize, std::min<uint64_t>(length, kMaxFieldNameLength));
+    for (Field& field : fields_)
+      if (length == name.size() && name == field.name)
+        field.firstValue = load<uint64_t>(bytes.data() + kFieldFirstValueAt);
+    offset = load<uint64_t>(bytes.data() + kNextInBucketAt);
+  }
+  return true;
+}
+
+// Companions must stand in as many entries as the field that they accompany.
+bool MarkedEntries::IndexReader::take(const EntryMark& mark) {
+  uint64_t entries = 0;
+  if (!takeValues(mark.field, mark.value, true, entries)) return false;
+  return std::all_of(mark.companions.begin(), mark.companions.end(), [&](std::string_view name) {
+    uint64_t others = 0;
+    return takeValues(name, {}, false, others) && others == entries;
+  });
+}
+
+// Looks at the values of a field, of which each was put before those that are older. Counts the
+// entries that refer to them and, where they are to be `listed`, takes their lists.
+bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_view value,
+                                            bool listed, uint64_t& entries) {
+  const size_t headerSize = file_.dataHeaderSize();
+  std::array<uint8_t, 256> bytes;
+  uint64_t previous = kNone;
+  uint64_t offset = std::find_if(fields_.begin(), fields_.end(), [&](const Field& field) {
+                      return field.name == name;
+                    })->firstValue;
+  for (size_t values = 0; offset != 0; ++values) {
+    if (values == kMaxValues || offset >= previous ||
+        !readObject(offset, kData, headerSize + name.size() + 1, bytes))
+      return false;
+    const uint64_t size = load<uint64_t>(bytes.data() + kObjectSizeAt) - headerSize;
+    const std::string_view text =
+        textAt(bytes.data() + headerSize, std::min<uint64_t>(size, bytes.size() - headerSize));
+    const auto count = load<uint64_t>(bytes.data() + kDataEntryCountAt);
+    if (text.size() <= name.size() || !text.starts_with(name) || text[name.size()] != '=' ||
+        count == 0 || count > file_.header().entryCount)
+      return false;
+    const bool counts =
+        value.empty() || (size == text.size() && text.substr(name.size() + 1) == value);
+    entries += counts ? count : 0;
+    if (listed && counts && !addList(bytes.data(), count)) return false;
+    previous = std::exchange(offset, load<uint64_t>(bytes.data() + kNextValueAt));
+  }
+  return true;
+}
+
+bool MarkedEntries::IndexReader::addList(const uint8_t* data, uint64_t entries) {
+  if (lists_.size() == kMaxLists) return false;
+  const auto first = load<uint64_t>(data + kDataFirstEntryAt);
+  lists_.push_back(
+      {EntryChain(file_, load<uint64_t>(data + kDataEntryArrayAt), entries - 1, kListPiece),
+       entries - 1, first, 0});
+  return first != 0 && lookAhead(lists_.back());
+}
+
+std::unique_ptr<MarkedEntries> MarkedEntries::of(JournalFile& file,
+                                                 std::span<const EntryMark> marks,
+                                                 size_t& listsLeft, const StopFlag& stop) {
+  IndexReader reader(file, stop);
+  if (!reader.read(marks)) return nullptr;
+  auto marked = std::make_unique<MarkedEntries>();
+  marked->lists_ = reader.lists();
+  if (marked->lists_.size() > listsLeft) return nullptr;
+  listsLeft -= marked->lists_.size();
+  marked->nearest_ = kNone;
+  for (const List& list : marked->lists_) marked->nearest_ = std::min(marked->nearest_, list.next);
+  return marked;
+}
+
+bool MarkedEntries::look(uint64_t offset) {
+  missed_ = nearest_ < offset;
+  usable_ = !missed_;
+  nearest_ = kNone;
+  for (List& list : lists_) {
+    if (list.next == offset) usable_ = advance(list) && usable_;
+    nearest_ = std::min(nearest_, list.next);
+  }
+  return true;
+}
+
+// False where the list goes on in a place that is damaged, or beyond its end.
+bool MarkedEntries::lookAhead(List& list) {
+  const uint64_t ahead = list.rest.next();
+  const bool more = list.left != 0;
+  list.left -= more;
+  list.ahead = more ? ahead : kNone;
+  return !list.rest.gapBefore() && (ahead != 0) == more && (!more || ahead > list.next);
+}
+
+bool MarkedEntries::advance(List& list) {
+  list.next = list.ahead;
+  return list.next == kNone || lookAhead(list);
+}
+
+}  // namespace tessel

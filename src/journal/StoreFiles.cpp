@@ -1,0 +1,183 @@
+#include "journal/StoreFiles.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <fstream>
+#include <memory>
+#include <set>
+#include <string_view>
+#include <system_error>
+#include <utility>
+
+namespace tessel {
+
+namespace {
+
+constexpr int kDeepestDirectory = 32;
+// A store that rotates faster than it is listed has been listed often enough after this many times.
+constexpr int kMostListings = 8;
+
+std::optional<StoreFileKind> kindOf(std::string_view name) {
+  if (name.ends_with(".journal") || name.ends_with(".journal~")) return StoreFileKind::journal;
+  if (name.ends_with(".export")) return StoreFileKind::exportStream;
+  return std::nullopt;
+}
+
+class Finder {
+ public:
+  Finder(size_t limit, const StopFlag& stop) : limit_(limit), stop_(stop) {}
+
+  // Lists `directory` until a listing shows nothing new; errno where it cannot be read.
+  int addDirectory(const std::string& directory);
+  void addFile(const std::string& path, StoreFileKind kind);
+  StoreFiles take();
+
+ private:
+  int list(const std::string& directory, int depth);
+  void fail(const std::string& path, StoreFileKind kind, int error);
+  void visit(const std::string& path, const dirent& entry, int depth);
+
+  const size_t limit_;
+  const StopFlag& stop_;
+  StoreFiles found_;
+  std::set<std::pair<dev_t, ino_t>> known_;
+  std::vector<StoreFile> failed_;  // of the listing under way
+};
+
+int Finder::addDirectory(const std::string& directory) {
+  int error = 0;
+  size_t before = SIZE_MAX;
+  const size_t failedElsewhere = failed_.size();
+  const uint64_t leftOutElsewhere = found_.leftOut;
+  for (int i = 0; i < kMostListings && before != known_.size() && !stop_.load(); ++i) {
+    before = known_.size();
+    // What fails only now and then was renamed or removed.
+    failed_.erase(failed_.begin() + static_cast<ptrdiff_t>(failedElsewhere), failed_.end());
+    found_.leftOut = leftOutElsewhere;
+    error = list(directory, 0);
+    if (error != 0) break;
+  }
+  return error;
+}
+
+int Finder::list(const std::string& directory, int depth) {
+  const std::unique_ptr<DIR, int (*)(DIR*)> listing(::opendir(directory.c_str()), ::closedir);
+  if (!listing) return errno;
+  while (const dirent* entry = ::readdir(listing.get())) {
+    if (stop_.load(std::memory_order_relaxed)) break;
+    visit(directory + "/" + entry->d_name, *entry, depth);
+  }
+  return 0;
+}
+
+void Finder::visit(const std::string& path, const dirent& entry, int depth) {
+  const std::string_view name = entry.d_name;
+  if (name == "." || name == "..") return;
+  bool isDirectory = entry.d_type == DT_DIR;
+  if (entry.d_type == DT_UNKNOWN) {
+    struct stat status {};
+    isDirectory = ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+  }
+  if (!isDirectory) {
+    if (const auto kind = kindOf(name)) addFile(path, *kind);
+    return;
+  }
+  if (depth >= kDeepestDirectory) return;
+  const int error = list(path, depth + 1);
+  if (error != 0 && error != ENOENT) fail(path, StoreFileKind::journal, error);
+}
+
+// Opening must not wait for the other end of a pipe, so that comes before asking what it is.
+void Finder::addFile(const std::string& path, StoreFileKind kind) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  if (!fd.valid()) {
+    if (errno != ENOENT) fail(path, kind, errno);
+    return;
+  }
+  struct stat status {};
+  if (::fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return;
+  const std::pair identity(status.st_dev, status.st_ino);
+  if (known_.count(identity) != 0) return;
+  if (known_.size() >= limit_) {
+    ++found_.leftOut;
+    return;
+  }
+  known_.insert(identity);
+  found_.files.push_back({path, kind, std::move(fd), 0});
+}
+
+void Finder::fail(const std::string& path, StoreFileKind kind, int error) {
+  if (failed_.size() < limit_) {
+    failed_.push_back({path, kind, {}, error});
+  } else {
+    ++found_.leftOut;
+  }
+}
+
+StoreFiles Finder::take() {
+  std::move(failed_.begin(), failed_.end(), std::back_inserter(found_.files));
+  std::sort(found_.files.begin(), found_.files.end(),
+            [](const StoreFile& a, const StoreFile& b) { return a.path < b.path; });
+  return std::move(found_);
+}
+
+// Every file of the store is held open; the usual soft limit of 1,024 is for programs that
+// select().
+void allowOpenFiles(size_t count) {
+  rlimit limit{};
+  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= count) return;
+  limit.rlim_cur = std::min<rlim_t>(count, limit.rlim_max);
+  ::setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+PlatformError storeError(const std::string& path, int error) {
+  return {path + ": " + whyNotOpened(error)};
+}
+
+std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
+  std::string machine;
+  std::ifstream("/etc/machine-id") >> machine;
+  if (machine.empty())
+    return PlatformError{"/etc/machine-id: the machine has no identity, so no journal"};
+  const std::string stored = "/var/log/journal/" + machine;
+  const int errors[] = {finder.addDirectory(stored),
+                        finder.addDirectory("/run/log/journal/" + machine)};
+  for (const int error : errors)
+    if (error != 0 && error != ENOENT) return storeError(stored, error);
+  if (errors[0] != 0 && errors[1] != 0)
+    return PlatformError{stored + ": the machine keeps no journal, here or under /run/log/journal"};
+  return finder.take();
+}
+
+}  // namespace
+
+std::string whyNotOpened(int error) {
+  std::string text = std::generic_category().message(error);
+  if (error == EACCES || error == EPERM)
+    text += " (members of the group systemd-journal may read the journal)";
+  return text;
+}
+
+std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
+                                                       size_t limit, const StopFlag& stop) {
+  constexpr size_t kOtherFiles = 256;
+  allowOpenFiles(limit + kOtherFiles);
+  Finder finder(limit, stop);
+  if (!path) return machineJournal(finder);
+  struct stat status {};
+  if (::stat(path->c_str(), &status) != 0) return storeError(*path, errno);
+  if (!S_ISDIR(status.st_mode)) {
+    if (!S_ISREG(status.st_mode)) return PlatformError{*path + ": neither a directory nor a file"};
+    finder.addFile(*path, kindOf(*path).value_or(StoreFileKind::journal));
+  } else if (const int error = finder.addDirectory(*path)) {
+    return storeError(*path, error);
+  }
+  return finder.take();
+}
+
+}  // namespace tessel

@@ -1,0 +1,240 @@
+#include "journal/TraceStore.h"
+
+#include <algorithm>
+#include <utility>
+#include <vector>
+
+#include "journal/ExportEntryStream.h"
+#include "journal/ForeignJournalStream.h"
+#include "journal/JournalEntryStream.h"
+#include "journal/LossTokenizer.h"
+#include "journal/StoreFiles.h"
+#include "journal/StoreMerger.h"
+
+namespace tessel {
+
+namespace {
+
+// Follows the numbers of each sequence and counts those that do not appear.
+class SequenceWatch {
+ public:
+  void see(const EntryHeader& entry) {
+    if (last_ < seen_.size() && sameId(seen_[last_].id, entry.sequenceId)) {
+      advance(seen_[last_], entry.sequenceNumber);
+    } else {
+      change(entry);
+    }
+  }
+  uint64_t gaps() const { return gaps_; }
+  uint64_t missing() const { return missing_; }
+
+ private:
+  // Sequences beyond this number are not followed.
+  static constexpr size_t kMaxSequences = 1024;
+
+  struct Sequence {
+    Id128 id;
+    uint64_t number;
+  };
+
+  void advance(Sequence& sequence, uint64_t number) {
+    if (number <= sequence.number) return;
+    const uint64_t leftOut = number - sequence.number - 1;
+    gaps_ += leftOut != 0;
+    missing_ += leftOut;
+    sequence.number = number;
+  }
+  void change(const EntryHeader& entry);
+
+  std::vector<Sequence> seen_;
+  size_t last_ = 0;
+  uint64_t gaps_ = 0;
+  uint64_t missing_ = 0;
+};
+
+void SequenceWatch::change(const EntryHeader& entry) {
+  if (entry.sequenceId == Id128{}) return;
+  const auto known = std::find_if(seen_.begin(), seen_.end(), [&](const Sequence& sequence) {
+    return sequence.id == entry.sequenceId;
+  });
+  if (known == seen_.end() && seen_.size() >= kMaxSequences) return;
+  last_ = static_cast<size_t>(known - seen_.begin());
+  if (known == seen_.end()) {
+    seen_.push_back({entry.sequenceId, entry.sequenceNumber});
+  } else {
+    advance(*known, entry.sequenceNumber);
+  }
+}
+
+static_assert(TraceStore::kMaxFiles <= TokenCache::kMaxFiles);
+
+// Of a stream whose entries may count in any sequence.
+constexpr Id128 kNoSequence{};
+
+}  // namespace
+
+struct TraceStore::State final : EntryStream {
+  State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag)
+      : range(timeRange), stop(stopFlag), tokenizer(user), merger(stopFlag) {
+    facts.rangeStart = range.start;
+  }
+
+  bool next() override;
+  const EntryHeader& header() const override { return merger.header(); }
+  Entry entry() override;
+
+  void openFiles(StoreFiles found);
+  void openFile(StoreFile& file, uint32_t number);
+  void openJournal(StoreFile& file, uint32_t number);
+  void openForeign(StoreFile& file, uint64_t entryCount, uint32_t number);
+  bool outsideRange(const JournalHeader& header) const;
+  std::optional<PlatformError> failure(const std::string& place) const;
+  void seeTime(uint64_t realtime) {
+    if (!facts.oldestEntry || realtime < *facts.oldestEntry) facts.oldestEntry = realtime;
+  }
+
+  const TimeRange range;
+  const StopFlag& stop;
+  JournalReadResources resources;
+  ExportReadResources exports{resources.windows};
+  LossTokenizer tokenizer;
+  const std::vector<EntryMark> marks = tokenizer.marks();
+  StoreReport facts;  // its files are complete before the first stream is made
+  size_t usableFiles = 0;
+  size_t foreignFiles = 0;  // that journalctl reads for us
+  SequenceWatch sequences;
+  StoreMerger merger;
+};
+
+bool TraceStore::State::next() {
+  while (merger.next()) {
+    const EntryHeader& entry = merger.header();
+    sequences.see(entry);
+    seeTime(entry.realtime);
+    if (entry.realtime < range.start || entry.realtime >= range.end) continue;
+    ++facts.entriesRead;
+    ++facts.files[merger.streamNumber()].entriesRead;
+    return true;
+  }
+  return false;
+}
+
+Entry TraceStore::State::entry() {
+  const Entry whole = merger.entry();
+  return {whole.header, tokenizer.takeOwn(whole.tokens)};
+}
+
+void TraceStore::State::openFiles(StoreFiles found) {
+  facts.filesNotLookedAt = found.leftOut;
+  facts.files.resize(found.files.size());
+  for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
+    facts.files[i].path = found.files[i].path;
+    openFile(found.files[i], i);
+  }
+}
+
+void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
+  FileReport& report = facts.files[number];
+  if (!file.fd.valid()) {
+    report.skipped = whyNotOpened(file.error);
+    return;
+  }
+  if (file.kind == StoreFileKind::exportStream) {
+    ++usableFiles;
+    merger.add(
+        std::make_unique<ExportEntryStream>(file.fd.release(), exports, tokenizer, stop, report),
+        number, kNoSequence);
+  } else {
+    openJournal(file, number);
+  }
+}
+
+void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
+  FileReport& report = facts.files[number];
+  auto opened = readJournalHeader(file.fd.get());
+  if (auto* reason = std::get_if<std::string>(&opened)) {
+    report.skipped = std::move(*reason);
+    return;
+  }
+  const auto& [header, size] = std::get<JournalBeginning>(opened);
+  if (header.unknownFlags() != 0) {
+    openForeign(file, header.entryCount, number);
+    return;
+  }
+  ++usableFiles;
+  if (header.headRealtime != 0) seeTime(header.headRealtime);
+  if (outsideRange(header)) {
+    report.skipped = "outside the range";
+    report.outsideRange = true;
+    return;
+  }
+  merger.add(std::make_unique<JournalEntryStream>(
+                 std::move(file.fd), size, header, number,
+                 JournalEntryStream::Context{resources, tokenizer, marks, stop, report}),
+             number, header.sequenceId);
+}
+
+// Each such file takes a process, so not all of a great many are read.
+void TraceStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
+  FileReport& report = facts.files[number];
+  if (foreignFiles == kMaxForeignFiles) {
+    report.skipped = "written with features that are not known, as are " +
+                     std::to_string(kMaxForeignFiles) + " files before it";
+    return;
+  }
+  auto stream =
+      ForeignJournalStream::start(file.path, entryCount, exports, tokenizer, stop, report);
+  if (!stream) {
+    report.skipped = "written with features that are not known";
+    return;
+  }
+  ++foreignFiles;
+  ++usableFiles;
+  merger.add(std::move(stream), number, kNoSequence);
+}
+
+// A clock that was set back within the file shows where its ends stand the wrong way round; one
+// that was also set forward again does not, and the file counts as what its ends say.
+bool TraceStore::State::outsideRange(const JournalHeader& header) const {
+  if (header.beingWritten() || header.headRealtime == 0 ||
+      header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
+    return false;
+  return header.tailRealtime < range.start || header.headRealtime >= range.end;
+}
+
+// Why the store as a whole cannot be used, where that is so.
+std::optional<PlatformError> TraceStore::State::failure(const std::string& place) const {
+  if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
+  if (facts.files.empty())
+    return PlatformError{place + ": holds no *.journal, *.journal~ or *.export file"};
+  const FileReport& first = facts.files.front();
+  return PlatformError{first.path + ": " + first.skipped.value_or("not readable")};
+}
+
+TraceStore::TraceStore(std::unique_ptr<State> state) : state_(std::move(state)) {}
+TraceStore::~TraceStore() = default;
+
+std::variant<std::unique_ptr<TraceStore>, PlatformError> TraceStore::open(
+    const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
+    const StopFlag& stop) {
+  auto found = openStoreFiles(path, kMaxFiles, stop);
+  if (auto* error = std::get_if<PlatformError>(&found)) return std::move(*error);
+  const std::string place = path.value_or("the machine's journal");
+  auto state = std::make_unique<State>(range, tokenizer, stop);
+  state->openFiles(std::get<StoreFiles>(std::move(found)));
+  if (auto error = state->failure(place)) return std::move(*error);
+  return std::unique_ptr<TraceStore>(new TraceStore(std::move(state)));
+}
+
+EntryStream& TraceStore::entries() { return *state_; }
+
+StoreReport TraceStore::report() const {
+  StoreReport report = state_->facts;
+  report.duplicateEntries = state_->merger.duplicates();
+  report.sequenceGaps = state_->sequences.gaps();
+  report.missingEntries = state_->sequences.missing();
+  report.dropped = state_->tokenizer.dropped();
+  return report;
+}
+
+}  // namespace tessel

@@ -1,0 +1,82 @@
+#include "journal/WindowedFile.h"
+
+#include <sys/stat.h>
+
+#include <cerrno>
+
+namespace tessel {
+
+namespace {
+constexpr size_t kFirstWindow = size_t{4} << 10;
+constexpr uint64_t kPage = 4096;
+}  // namespace
+
+WindowedFile::WindowedFile(UniqueFd fd, uint64_t size, WindowBudget& budget)
+    : fd_(std::move(fd)), size_(size), budget_(budget) {
+  budget_.join();
+}
+
+WindowedFile::~WindowedFile() { budget_.leave(); }
+
+const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
+  if (const uint8_t* bytes = inWindow(offset, size)) return bytes;
+  if (offset > size_ || size > size_ - offset) return nullptr;
+  const size_t capacity = std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share());
+  const uint64_t end = offset + size;
+  uint64_t start = std::min(from, offset);
+  // Half of the window is kept for what comes next.
+  if (end - start > capacity / 2)
+    start = std::max(start, offset - std::min<uint64_t>(offset, capacity / 2));
+  start -= start % (capacity >= 8 * kPage ? kPage : 8);
+  moveWindow(start, static_cast<size_t>(end - start));
+  return inWindow(offset, size);
+}
+
+void WindowedFile::moveWindow(uint64_t start, size_t least) {
+  const size_t wanted =
+      std::max(least, std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share()));
+  if (wanted != windowCapacity_) {
+    window_.reset();
+    window_ = std::make_unique_for_overwrite<uint8_t[]>(wanted);
+    windowCapacity_ = wanted;
+  }
+  windowStart_ = start;
+  windowLength_ = 0;
+  const size_t length = static_cast<size_t>(std::min<uint64_t>(wanted, size_ - start));
+  windowLength_ = read(start, {window_.get(), length});
+}
+
+std::span<const uint8_t> WindowedFile::restOfWindow(uint64_t offset) const {
+  if (offset < windowStart_ || offset - windowStart_ > windowLength_) return {};
+  const size_t skipped = static_cast<size_t>(offset - windowStart_);
+  return {window_.get() + skipped, windowLength_ - skipped};
+}
+
+uint64_t WindowedFile::nextWritten(uint64_t offset) const {
+  const off_t found = ::lseek(fd_.get(), static_cast<off_t>(offset), SEEK_DATA);
+  if (found < 0) return errno == ENXIO ? size_ : offset;
+  return std::max(offset, static_cast<uint64_t>(found) & ~uint64_t{7});
+}
+
+size_t WindowedFile::read(uint64_t offset, std::span<uint8_t> target) {
+  size_t done = 0;
+  while (done < target.size()) {
+    const ssize_t got = ::pread(fd_.get(), target.data() + done, target.size() - done,
+                                static_cast<off_t>(offset + done));
+    if (got < 0 && errno == EINTR) continue;
+    if (got <= 0) {
+      // Within what the file held when it was opened: it was cut short, or it cannot be read.
+      if (offset + done < size_) {
+        failed_ = true;
+        struct stat status {};
+        if (::fstat(fd_.get(), &status) == 0)
+          size_ = std::min(size_, static_cast<uint64_t>(status.st_size));
+      }
+      break;
+    }
+    done += static_cast<size_t>(got);
+  }
+  return done;
+}
+
+}  // namespace tessel

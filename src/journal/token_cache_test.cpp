@@ -1,0 +1,45 @@
+// What is remembered of a place is never taken for what is remembered of another.
+
+#include "journal/TokenCache.h"
+
+#include <gtest/gtest.h>
+
+#include <map>
+#include <random>
+#include <utility>
+
+namespace tessel {
+namespace {
+
+TEST(TokenCacheTest, AnswersForAPlaceWhatWasLastStoredThereOrNothing) {
+  TokenCache cache;
+  std::mt19937_64 random(1);
+  std::map<std::pair<uint32_t, uint64_t>, FieldToken> stored;
+  const auto place = [&](uint64_t range) {
+    // From the first to the last file, from the beginning to the last offset.
+    const auto file = static_cast<uint32_t>(random() % 2 == 0 ? 0 : TokenCache::kMaxFiles - 1);
+    const uint64_t offset = random() % range * 64;
+    return std::pair(file, random() % 2 == 0 ? offset : TokenCache::kMaxOffset - 63 - offset);
+  };
+  for (const uint64_t range : {uint64_t{1000}, uint64_t{10'000'000}}) {
+    size_t known = 0;
+    for (FieldToken token = 0; token < 200'000; ++token) {
+      const auto written = place(range);
+      TokenCache::OfFile(cache, written.first).store(written.second, token);
+      stored[written] = token;
+      const auto asked = place(range);
+      const FieldToken found = TokenCache::OfFile(cache, asked.first).find(asked.second);
+      if (found == TokenCache::kUnknown) continue;
+      ++known;
+      ASSERT_TRUE(stored.contains(asked));
+      ASSERT_EQ(found, stored[asked]);
+    }
+    EXPECT_GT(known, range == 1000 ? 150'000 : 0);
+  }
+  cache.useGeneration(1);
+  for (const auto& [known, token] : stored)
+    ASSERT_EQ(TokenCache::OfFile(cache, known.first).find(known.second), TokenCache::kUnknown);
+}
+
+}  // namespace
+}  // namespace tessel

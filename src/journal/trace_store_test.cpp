@@ -1,0 +1,332 @@
+// Stores of files of every kind. What the journal's own tools write is read beside libsystemd and
+// journalctl in tests/reading.
+
+#include "journal/TraceStore.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <map>
+#include <random>
+
+#include "journal/ForeignJournalStream.h"
+#include "journal/JournalFormat.h"
+#include "journal/LossTokenizer.h"
+#include "journal/testing/JournalOracle.h"
+#include "journal/testing/JournalWriter.h"
+#include "os/testing/TemporaryDirectory.h"
+
+namespace tessel {
+namespace {
+
+using ::testing::HasSubstr;
+using testing::JournalLayout;
+using testing::JournalWriter;
+using testing::PlainEntry;
+using testing::TemporaryDirectory;
+
+struct Reading {
+  std::vector<PlainEntry> entries;
+  StoreReport report;
+  std::string error;
+};
+
+Reading readStore(const std::string& path, TimeRange range = {}) {
+  testing::RecordingTokenizer tokenizer;
+  StopFlag stop{false};
+  auto opened = TraceStore::open(path, range, tokenizer, stop);
+  if (auto* error = std::get_if<PlatformError>(&opened))
+    return {{}, {}, error->localizedDescription};
+  TraceStore& store = *std::get<0>(opened);
+  Reading reading;
+  reading.entries = testing::readAll(store.entries(), tokenizer);
+  reading.report = store.report();
+  return reading;
+}
+
+std::vector<uint64_t> numbers(const Reading& reading) {
+  std::vector<uint64_t> all;
+  for (const PlainEntry& entry : reading.entries) all.push_back(entry.header.sequenceNumber);
+  return all;
+}
+
+std::string someJournal(size_t count, uint64_t firstSequence = 1, JournalLayout layout = {}) {
+  JournalWriter writer(layout);
+  writer.addSome(count, firstSequence);
+  return writer.bytes();
+}
+
+TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
+  using namespace journal_format;
+  const JournalLayout layouts[] = {
+      {.compression = kXz},
+      {.compression = kLz4},
+      {.compression = kZstd},
+      {.compact = true, .compression = kXz},
+      {.headerSize = 240},
+      {.headerSize = 256, .state = kOffline},
+      {.headerSize = 264, .state = kOnline},
+      {.headerSize = 272},
+      {.sealEvery = 10},
+      {.compact = true, .compression = kLz4, .headerSize = 272, .sealEvery = 3},
+  };
+  const TemporaryDirectory directory;
+  for (const JournalLayout& layout : layouts) {
+    const std::string path = directory.write("one.journal", someJournal(500, 1, layout));
+    const Reading reading = readStore(path);
+    const size_t number = static_cast<size_t>(&layout - layouts);
+    EXPECT_EQ(reading.entries.size(), 500u) << number;
+    EXPECT_TRUE(reading.entries == testing::readWithLibsystemd({path})) << number;
+    EXPECT_TRUE(reading.report.files.at(0).problems.empty()) << number;
+  }
+}
+
+TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
+  const TemporaryDirectory directory;
+  directory.write("a.journal", someJournal(20, 1));
+  directory.write("b.journal", someJournal(20, 11));
+  directory.write("c.journal", someJournal(5, 15));
+  JournalWriter twice({.sequenceId = {9}});
+  twice.addSome(1, 1);
+  twice.addSome(1, 1);
+  directory.write("twice.journal", twice.bytes());
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 32u);
+  EXPECT_EQ(reading.report.entriesRead, 32u);
+  EXPECT_EQ(reading.report.duplicateEntries, 15u);
+}
+
+// Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
+// all of them.
+TEST(TraceStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
+  constexpr size_t kEntries = 60;
+  for (unsigned seed = 0; seed < 10; ++seed) {
+    std::mt19937 random(seed);
+    const TemporaryDirectory directory;
+    for (uint8_t sequence = 1; sequence <= 4; ++sequence) {
+      JournalWriter writer({.sequenceId = {sequence}});
+      EntryHeader header;
+      for (size_t i = 0; i < kEntries; ++i) {
+        if (i % 20 == 0) header.bootId = {static_cast<uint8_t>(random() % 3)};
+        if (i % 20 == 0) header.monotonic = 1 + random() % 50;
+        if (i % 15 == 0) header.realtime = 1000 + random() % 50;
+        header.monotonic += 1 + random() % 3;
+        header.realtime += 1 + random() % 3;
+        writer.add(header, {"MESSAGE=" + std::to_string(random())});
+        // A copy from when the file was not yet as long, and one of all of it.
+        if (i % 30 == 29)
+          directory.write(std::to_string(sequence) + (i > 30 ? "" : "early") + ".journal",
+                          writer.bytes());
+      }
+      directory.write(std::to_string(sequence) + "copy.journal", writer.bytes());
+    }
+    const Reading reading = readStore(directory.path());
+    std::map<Id128, std::vector<uint64_t>> numbers;
+    for (const PlainEntry& entry : reading.entries)
+      numbers[entry.header.sequenceId].push_back(entry.header.sequenceNumber);
+    EXPECT_EQ(reading.entries.size(), 4 * kEntries) << seed;
+    EXPECT_EQ(reading.report.duplicateEntries, 4 * (kEntries + 30)) << seed;
+    EXPECT_EQ(reading.report.missingEntries, 0u) << seed;
+    for (const auto& [sequence, all] : numbers)
+      EXPECT_TRUE(std::is_sorted(all.begin(), all.end())) << seed;
+  }
+}
+
+TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
+  const TemporaryDirectory directory;
+  constexpr uint64_t kBase = 1'795'300'000'000'000;
+  directory.write("a.journal", someJournal(10, 1));
+  directory.write("b.journal", someJournal(10, 11));
+  directory.write("live.journal", someJournal(5, 30, {.state = journal_format::kOnline}));
+  const Reading reading = readStore(directory.path(), {kBase + 13'000'000, kBase + 16'000'000});
+  EXPECT_EQ(numbers(reading), (std::vector<uint64_t>{13, 14, 15}));
+  EXPECT_EQ(reading.report.files.at(0).skipped, "outside the range");
+  EXPECT_TRUE(reading.report.files.at(0).outsideRange);
+  EXPECT_EQ(reading.report.files.at(1).entriesRead, 3u);
+  EXPECT_FALSE(reading.report.files.at(2).skipped);
+  EXPECT_EQ(reading.report.oldestEntry, kBase + 1'000'000);
+  EXPECT_TRUE(reading.report.reachesRangeStart());
+}
+
+TEST(TraceStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
+  const TemporaryDirectory directory;
+  JournalWriter system, user({.sequenceId = {9}});
+  for (uint64_t i = 1; i <= 40; ++i) {
+    EntryHeader header;
+    header.bootId = {1};
+    header.monotonic = 10 * i;
+    header.realtime = 1000 + i - (i > 20 ? 30 : 0);
+    system.add(header, {"PRIORITY=6"});
+    header.monotonic += 5;
+    if (i == 22) user.add(header, {"_UID=1000"});
+  }
+  const std::string a = directory.write("system.journal", system.bytes());
+  const std::string b = directory.write("user-1000.journal", user.bytes());
+  const Reading all = readStore(directory.path());
+  EXPECT_TRUE(all.entries == testing::readWithLibsystemd({a, b}));
+  EXPECT_EQ(all.entries.at(22).fields, std::vector<std::string>{"_UID=1000"});
+  EXPECT_EQ(numbers(readStore(directory.path(), {1005, 1008})),
+            (std::vector<uint64_t>{5, 6, 7, 35, 36, 37}));
+  EXPECT_EQ(numbers(readStore(a, {999, 1002})), (std::vector<uint64_t>{1, 29, 30, 31}));
+}
+
+TEST(TraceStoreTest, TellsGapsInTheSequence) {
+  const TemporaryDirectory directory;
+  directory.write("a.journal", someJournal(10, 1));
+  directory.write("b.journal", someJournal(10, 14));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.report.sequenceGaps, 1u);
+  EXPECT_EQ(reading.report.missingEntries, 3u);
+  const std::string last = "__REALTIME_TIMESTAMP=1\n__SEQNUM_ID=" + std::string(32, 'a') +
+                           "\n__SEQNUM=18446744073709551615\n\n";
+  EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.sequenceGaps, 0u);
+}
+
+TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
+  const TemporaryDirectory directory;
+  JournalWriter writer;
+  EntryHeader header;
+  header.realtime = header.monotonic = 1;
+  const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  writer.add(header, {message, "N_DROPPED=12", "OBJECT_SYSTEMD_UNIT=a.service"});
+  writer.add(header, {"MESSAGE_ID=other", "N_DROPPED=100", "OBJECT_SYSTEMD_UNIT=a.service"});
+  writer.add(header, {message, "N_DROPPED=5", "OBJECT_SYSTEMD_UNIT=a.service", "PRIORITY=4"});
+  writer.add(header, {message, "N_DROPPED=1"});
+  const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
+  ASSERT_EQ(reading.report.dropped.size(), 2u);
+  EXPECT_EQ(reading.report.dropped[0].unit, "");
+  EXPECT_EQ(reading.report.dropped[0].count, 1u);
+  EXPECT_EQ(reading.report.dropped[1].unit, "a.service");
+  EXPECT_EQ(reading.report.dropped[1].count, 17u);
+  EXPECT_EQ(reading.entries.at(2).fields, (std::vector<std::string>{"PRIORITY=4"}));
+}
+
+// Anyone may write such entries, with any values.
+TEST(TraceStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
+  const TemporaryDirectory directory;
+  JournalWriter writer;
+  EntryHeader header;
+  header.realtime = header.monotonic = 1;
+  const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  constexpr uint64_t kLosses = 5000;
+  static_assert(kLosses > LossTokenizer::kMaxUnits);
+  for (uint64_t i = 1; i <= kLosses; ++i) {
+    const std::string number = std::to_string(i);
+    writer.add(header, {message, "N_DROPPED=" + number, "OBJECT_SYSTEMD_UNIT=u" + number});
+  }
+  const std::string tooLong(LossTokenizer::kMaxUnitLength + 1, 'u');
+  writer.add(header, {message, "N_DROPPED=1", "OBJECT_SYSTEMD_UNIT=" + tooLong});
+  writer.add(header, {message, "N_DROPPED=some"});
+  const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
+  uint64_t sum = 0;
+  for (const DroppedEntries& dropped : reading.report.dropped) sum += dropped.count;
+  EXPECT_EQ(sum, kLosses * (kLosses + 1) / 2 + 1);
+  EXPECT_EQ(reading.report.dropped.size(), LossTokenizer::kMaxUnits + 1);
+  EXPECT_EQ(reading.report.dropped[0].unit, "");
+}
+
+TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
+  const TemporaryDirectory directory;
+  const std::string noise = directory.write("noise/noise.journal", std::string(5000, '\x5a'));
+  EXPECT_THAT(readStore("/nowhere").error, HasSubstr("/nowhere: No such file"));
+  EXPECT_THAT(readStore(noise).error, HasSubstr(noise + ": not a journal file"));
+  EXPECT_THAT(readStore(directory.path("noise")).error, HasSubstr("not a journal file"));
+  std::filesystem::create_directory(directory.path("empty"));
+  EXPECT_THAT(readStore(directory.path("empty")).error, HasSubstr("holds no *.journal"));
+  EXPECT_THAT(readStore("/dev/null").error, HasSubstr("neither a directory nor a file"));
+}
+
+TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {
+  const TemporaryDirectory directory;
+  directory.write("bad.journal", std::string(5000, '\x5a'));
+  directory.write("empty.journal", "");
+  directory.write("good.journal~", someJournal(10));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  EXPECT_EQ(reading.report.files.at(0).skipped, "not a journal file");
+  EXPECT_EQ(reading.report.files.at(1).skipped, "it is empty");
+}
+
+// journalctl does not know the flag either, which is as near as a test comes to a newer one.
+TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
+  const TemporaryDirectory directory;
+  std::string file = someJournal(10);
+  file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
+  directory.write("foreign.journal", file);
+  file.replace(journal_format::kEntryCountAt, 8, 8, '\xff');
+  directory.write("foreign_boast.journal", file);
+  directory.write("known.journal", someJournal(10));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  ASSERT_FALSE(reading.report.files.at(0).problems.empty());
+  const FileProblem& last = reading.report.files.at(0).problems.back();
+  EXPECT_EQ(last.reason, "entries that journalctl did not read");
+  EXPECT_EQ(last.count, 10u);
+  EXPECT_LE(reading.report.files.at(1).problems.back().count, file.size())
+      << "no more than the file can hold";
+}
+
+// It would else be decompressed for each of the entry's items.
+TEST(TraceStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
+  const TemporaryDirectory directory;
+  JournalLayout layout;
+  layout.compression = journal_format::kZstd;
+  JournalWriter writer(layout);
+  writer.add({.realtime = 1},
+             std::vector<std::string>(1000, "TESSEL_NAME=" + std::string(4000, 'x')));
+  std::string file = writer.bytes();
+  const uint64_t thousand = 1000;
+  const uint64_t one = 1;
+  const size_t count =
+      file.find(std::string(reinterpret_cast<const char*>(&thousand), 8), layout.headerSize);
+  ASSERT_NE(count, std::string::npos);
+  file.replace(count, 8, reinterpret_cast<const char*>(&one), 8);
+  const std::string path = directory.write("a.journal", file);
+  testing::RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  ASSERT_EQ(testing::readAll(std::get<0>(opened)->entries(), tokenizer).at(0).fields.size(), 1000u);
+  EXPECT_EQ(tokenizer.shown(), 1u);
+}
+
+TEST(TraceStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
+  const TemporaryDirectory directory;
+  std::string file = someJournal(1);
+  file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
+  for (size_t i = 0; i <= TraceStore::kMaxForeignFiles; ++i)
+    directory.write(std::to_string(100 + i) + ".journal", file);
+  const Reading reading = readStore(directory.path());
+  for (size_t i = 0; i < TraceStore::kMaxForeignFiles; ++i)
+    EXPECT_EQ(reading.report.files.at(i).skipped, std::nullopt) << i;
+  EXPECT_THAT(reading.report.files.back().skipped.value_or(""), HasSubstr("16 files before it"));
+}
+
+TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
+  const TemporaryDirectory directory;
+  const std::string path = directory.write("a.journal", someJournal(100));
+  testing::RecordingTokenizer tokenizer;
+  const StopFlag stop{false};
+  FileReport report;
+  WindowBudget windows;
+  ExportReadResources resources{windows};
+  const auto stream = ForeignJournalStream::start(path, 100, resources, tokenizer, stop, report);
+  ASSERT_NE(stream, nullptr);
+  EXPECT_EQ(testing::readAll(*stream, tokenizer).size(), 100u);
+  EXPECT_TRUE(report.problems.empty());
+}
+
+TEST(TraceStoreTest, ReadsAFileOfSeveralNamesOnce) {
+  const TemporaryDirectory directory;
+  const std::string path = directory.write("a.journal", someJournal(10));
+  std::filesystem::create_hard_link(path, directory.path("b.journal"));
+  std::filesystem::create_symlink(path, directory.path("c.journal"));
+  const Reading reading = readStore(directory.path());
+  EXPECT_EQ(reading.entries.size(), 10u);
+  EXPECT_EQ(reading.report.files.size(), 1u);
+}
+
+}  // namespace
+}  // namespace tessel

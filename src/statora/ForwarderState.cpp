@@ -1,0 +1,245 @@
+// Reading, acknowledging and setting aside rows of the spool.
+
+#include "statora/ForwarderState.h"
+
+#include <sqlite3.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <utility>
+
+#include "statora/SpoolDatabase.h"
+
+namespace tessel {
+
+namespace {
+
+// The forwarder has time; the service goes first.
+constexpr int kForwardersPatience = 5000;  // milliseconds
+
+// Few enough that the service, whose next send may come at any moment, has no need to wait.
+constexpr size_t kRowsRemovedAtOnce = 128;
+
+constexpr char kTables[] =
+    "BEGIN IMMEDIATE;"
+    "CREATE TABLE IF NOT EXISTS forwarder(name TEXT PRIMARY KEY, value INTEGER NOT NULL) WITHOUT "
+    "ROWID;"
+    "CREATE TABLE IF NOT EXISTS forwarder_set_aside(id INTEGER PRIMARY KEY, time INTEGER NOT NULL,"
+    " name TEXT NOT NULL, payload TEXT NOT NULL, at INTEGER NOT NULL, status INTEGER NOT NULL,"
+    " words TEXT NOT NULL);"
+    "COMMIT";
+
+struct Counter {
+  const char* name;
+  uint64_t ForwarderCounters::*value;
+};
+constexpr Counter kCounters[] = {
+    {"delivered", &ForwarderCounters::delivered},
+    {"rejected", &ForwarderCounters::rejected},
+    {"set_aside", &ForwarderCounters::setAside},
+    {"set_aside_dropped", &ForwarderCounters::setAsideDropped},
+    {"requests", &ForwarderCounters::requests},
+    {"retries", &ForwarderCounters::retries},
+    {"bytes_sent", &ForwarderCounters::bytesSent},
+    {"position", &ForwarderCounters::position},
+    {"last_success", &ForwarderCounters::lastSuccess},
+};
+
+}  // namespace
+
+std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database) {
+  SqliteStatement select = database.prepare("SELECT name, value FROM forwarder");
+  if (!select.prepared()) return {};
+  ForwarderCounters counters;
+  while (select.step() == SqliteStatement::Step::row) {
+    const auto* const known =
+        std::find_if(std::begin(kCounters), std::end(kCounters),
+                     [&](const Counter& counter) { return select.text(0) == counter.name; });
+    if (known != std::end(kCounters))
+      counters.*known->value = static_cast<uint64_t>(select.integer(1));
+  }
+  return counters;
+}
+
+ForwarderState::ForwarderState(std::string stateDirectory, uint64_t maxSetAside)
+    : path_(std::move(stateDirectory) + "/" + kSpoolFileName), maxSetAside_(maxSetAside) {}
+
+bool ForwarderState::exists() const {
+  struct stat facts {};
+  return ::stat(path_.c_str(), &facts) == 0;
+}
+
+SqliteStatus ForwarderState::open() {
+  if (database_.isOpen() && isStillThere()) return {};
+  SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
+  // A lost acknowledgement is no lost event, so none is flushed. The write-ahead log, which grows
+  // here, is emptied here, before the service comes to do it in the middle of a send.
+  if (status.ok())
+    status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
+  if (status.ok() &&
+      !database_.integer("SELECT 1 FROM sqlite_schema WHERE name='forwarder_set_aside'")) {
+    status = database_.execute(kTables);
+  }
+  if (status.ok()) status = prepareStatements();
+  if (status.ok()) counters_ = readForwarderCounters(database_).value_or(ForwarderCounters{});
+  if (!status.ok()) database_.close();
+  return status;
+}
+
+SqliteStatus ForwarderState::openReadOnly() {
+  SqliteStatus status = openFresh(SqliteDatabase::Mode::readOnly);
+  if (!status.ok()) return status;
+  select_ = database_.prepare(
+      "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2", true);
+  return select_.prepared() ? SqliteStatus{} : database_.status();
+}
+
+bool ForwarderState::isStillThere() const {
+  struct stat facts {};
+  return ::stat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
+}
+
+SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
+  for (SqliteStatement* statement : {&select_, &remove_, &keep_, &trim_, &count_}) *statement = {};
+  // Closing would empty and delete the write-ahead log by its name, which by now may be another's.
+  database_.abandon();
+  struct stat facts {};
+  if (::stat(path_.c_str(), &facts) == 0) {
+    device_ = facts.st_dev;
+    inode_ = facts.st_ino;
+  }
+  SqliteStatus status = database_.open(path_, mode);
+  if (!status.ok()) return status;
+  database_.setBusyTimeout(kForwardersPatience);
+  const auto version = database_.integer("PRAGMA user_version");
+  if (!version) return database_.status();
+  if (*version != kSpoolSchemaVersion) {
+    return {SQLITE_SCHEMA,
+            "the spool was made by another version (schema " + std::to_string(*version) + ")"};
+  }
+  const auto id = database_.text("SELECT value FROM meta WHERE key='spool_id'");
+  if (!id) return {SQLITE_CORRUPT, "the spool has no identifier"};
+  spoolId_ = *id;
+  return {};
+}
+
+SqliteStatus ForwarderState::prepareStatements() {
+  const auto prepare = [this](SqliteStatement& statement, std::string_view text) {
+    statement = database_.prepare(text, true);
+    return statement.prepared();
+  };
+  const bool good =
+      prepare(select_,
+              "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2") &&
+      prepare(remove_, "DELETE FROM events WHERE id=?1") &&
+      prepare(keep_,
+              "INSERT OR REPLACE INTO forwarder_set_aside VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7)") &&
+      prepare(
+          trim_,
+          "DELETE FROM forwarder_set_aside WHERE id IN"
+          " (SELECT id FROM forwarder_set_aside ORDER BY at DESC, id DESC LIMIT -1 OFFSET ?1)") &&
+      prepare(count_, "INSERT OR REPLACE INTO forwarder VALUES(?1, ?2)");
+  return good ? SqliteStatus{} : database_.status();
+}
+
+std::vector<SpooledEvent> ForwarderState::oldest(size_t maxRows, size_t maxBytes, int64_t after) {
+  std::vector<SpooledEvent> events;
+  size_t bytes = 0;
+  select_.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
+  while (bytes < maxBytes && select_.step() == SqliteStatement::Step::row) {
+    events.push_back({select_.integer(0), select_.integer(1), std::string(select_.text(2)),
+                      std::string(select_.text(3))});
+    bytes += events.back().name.size() + events.back().payload.size();
+  }
+  select_.reset();
+  return events;
+}
+
+uint64_t ForwarderState::waiting() {
+  return static_cast<uint64_t>(
+      database_
+          .integer(
+              "SELECT coalesce((SELECT max(id) FROM events) - (SELECT min(id) FROM events) + 1, 0)")
+          .value_or(0));
+}
+
+bool ForwarderState::writeCounters() {
+  return std::all_of(std::begin(kCounters), std::end(kCounters), [this](const Counter& counter) {
+    return count_.bind(1, std::string_view(counter.name))
+        .bind(2, static_cast<int64_t>(counters_.*counter.value))
+        .run();
+  });
+}
+
+// Ends a transaction: commits what went well and takes back what did not.
+SqliteStatus ForwarderState::finish(bool good) {
+  SqliteStatus status = good ? database_.execute("COMMIT") : database_.status();
+  if (!status.ok()) database_.execute("ROLLBACK");
+  return status;
+}
+
+SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, Date now) {
+  counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
+  while (!ids.empty()) {
+    const auto step = ids.first(std::min(ids.size(), kRowsRemovedAtOnce));
+    if (SqliteStatus status = remove(step); !status.ok()) return status;
+    ids = ids.subspan(step.size());
+  }
+  return {};
+}
+
+SqliteStatus ForwarderState::remove(std::span<const int64_t> ids) {
+  if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
+  const ForwarderCounters before = counters_;
+  counters_.delivered += ids.size();
+  counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
+  SqliteStatus status =
+      finish(std::all_of(ids.begin(), ids.end(),
+                         [this](int64_t id) { return remove_.bind(1, id).run(); }) &&
+             writeCounters());
+  if (!status.ok()) counters_ = before;
+  return status;
+}
+
+SqliteStatus ForwarderState::setAside(const SpooledEvent& event, int64_t collectorStatus,
+                                      std::string_view words, Date now) {
+  if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
+  const ForwarderCounters before = counters_;
+  keep_.bind(1, event.id).bind(2, event.time).bind(3, event.name).bind(4, event.payload);
+  keep_.bind(5, int64_t{now.time_since_epoch().count()}).bind(6, collectorStatus).bind(7, words);
+  bool good = keep_.run() && remove_.bind(1, event.id).run() &&
+              trim_.bind(1, static_cast<int64_t>(maxSetAside_)).run();
+  if (good) {
+    counters_.setAsideDropped += static_cast<uint64_t>(database_.changes());
+    ++counters_.setAside;
+    good = writeCounters();
+  }
+  SqliteStatus status = finish(good);
+  if (!status.ok()) counters_ = before;
+  return status;
+}
+
+SqliteStatus ForwarderState::storeCounters() {
+  if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
+  return finish(writeCounters());
+}
+
+std::optional<int64_t> ForwarderState::requeue() {
+  const SqliteStatus status = database_.execute(
+      "BEGIN IMMEDIATE;"
+      "INSERT INTO events(id, time, name, payload) SELECT id, time, name, payload FROM "
+      "forwarder_set_aside;");
+  const int64_t rows = database_.changes();
+  const bool good = status.ok() && database_.execute("DELETE FROM forwarder_set_aside").ok();
+  if (!finish(good).ok()) return {};
+  return rows;
+}
+
+bool ForwarderState::shrink(int pages) {
+  if (database_.integer("PRAGMA freelist_count").value_or(0) == 0) return false;
+  SqliteStatement vacuum =
+      database_.prepare("PRAGMA incremental_vacuum(" + std::to_string(pages) + ")");
+  return vacuum.prepared() && vacuum.run();
+}
+
+}  // namespace tessel

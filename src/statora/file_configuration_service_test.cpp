@@ -1,0 +1,201 @@
+// Observing configurations on real files.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <mutex>
+#include <thread>
+
+#include "os/testing/TemporaryDirectory.h"
+#include "platform/Semaphore.h"
+#include "platform/WorkerQueue.h"
+#include "statora/FileConfigurationService.h"
+
+namespace tessel {
+namespace {
+
+using testing::TemporaryDirectory;
+
+constexpr char kType[] = "com.vantor.performance.tessel_reporter_tasking";
+constexpr std::chrono::seconds kDeadline{30};
+// More than two looks long: nothing that was going to be called would come later.
+constexpr std::chrono::milliseconds kQuiet{600};
+
+// Keeps the text under "v" of every configuration that it is called with; "absent" for none.
+class RecordingDelegate final : public ConfigurationObserverDelegate {
+ public:
+  void observerDidChangeConfiguration(
+      ConfigurationObserver& /*observer*/,
+      const std::shared_ptr<const ConfigurationValue>& configuration,
+      const std::string& type) override {
+    EXPECT_EQ(type, kType);
+    {
+      const std::lock_guard lock(mutex_);
+      calls_.push_back(textOf(configuration));
+    }
+    called_.signal();
+  }
+  // The next call; "none" where there is none in time.
+  std::string next(std::chrono::milliseconds deadline = kDeadline) {
+    if (!called_.waitFor(deadline)) return "none";
+    const std::lock_guard lock(mutex_);
+    return calls_[taken_++];
+  }
+
+ private:
+  static std::string textOf(const std::shared_ptr<const ConfigurationValue>& configuration) {
+    if (!configuration) return "absent";
+    const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
+    if (dictionary == nullptr) return "no dictionary";
+    const auto found = dictionary->find("v");
+    return found == dictionary->end() ? "no v" : std::get<std::string>(found->second.value);
+  }
+
+  std::mutex mutex_;
+  std::vector<std::string> calls_;
+  size_t taken_ = 0;
+  Semaphore called_{0};
+};
+
+class FileConfigurationServiceTest : public ::testing::Test {
+ protected:
+  static constexpr const char* kFile = "com.vantor.performance.tessel_reporter_tasking.json";
+
+  void observe() { observe(directory_.path()); }
+  void observe(const std::string& directory) {
+    observer_ = FileConfigurationService(directory).makeObserver();
+    observer_->setDelegate(delegate_, queue_);
+    observer_->startObserving(kType);
+  }
+  void replaceByRename(const std::string& text) {
+    directory_.write("new", text);
+    std::filesystem::rename(directory_.path("new"), directory_.path(kFile));
+  }
+
+  TemporaryDirectory directory_;
+  std::shared_ptr<RecordingDelegate> delegate_ = std::make_shared<RecordingDelegate>();
+  std::shared_ptr<WorkerQueue> queue_ = std::make_shared<WorkerQueue>("test");
+  std::shared_ptr<ConfigurationObserver> observer_;
+};
+
+TEST_F(FileConfigurationServiceTest, CallsOnceAtTheStartAndAgainOnEachChange) {
+  directory_.write(kFile, R"({"v":"one"})");
+  observe();
+  EXPECT_EQ(delegate_->next(), "one");
+  directory_.write(kFile, R"({"v":"rewritten in place"})");
+  EXPECT_EQ(delegate_->next(), "rewritten in place");
+  replaceByRename(R"({"v":"replaced"})");
+  EXPECT_EQ(delegate_->next(), "replaced");
+  std::filesystem::remove(directory_.path(kFile));
+  EXPECT_EQ(delegate_->next(), "absent");
+  directory_.write(kFile, R"(["v"])");
+  EXPECT_EQ(delegate_->next(), "no dictionary");
+  directory_.write(kFile, R"({"v":)");
+  EXPECT_EQ(delegate_->next(), "absent");
+  directory_.write(kFile, R"({"v":"back"})");
+  EXPECT_EQ(delegate_->next(), "back");
+  replaceByRename(R"({"v":"back"})");
+  directory_.write("another.json", R"({"v":"other"})");
+  EXPECT_EQ(delegate_->next(kQuiet), "none") << "nothing changed";
+}
+
+TEST_F(FileConfigurationServiceTest, NoFileNoCallUntilThereIsOne) {
+  observe(directory_.path("later/still"));
+  EXPECT_EQ(delegate_->next(kQuiet), "none");
+  std::filesystem::create_directories(directory_.path("later/still"));
+  EXPECT_EQ(delegate_->next(kQuiet), "none");
+  directory_.write(std::string("later/still/") + kFile, R"({"v":"made"})");
+  EXPECT_EQ(delegate_->next(), "made");
+}
+
+TEST_F(FileConfigurationServiceTest, AReplacedDirectoryAndReplacedLinksAreFollowed) {
+  for (const char* name : {"a", "b", "c"}) {
+    std::filesystem::create_directory(directory_.path(name));
+    directory_.write(std::string(name) + "/" + kFile, std::string(R"({"v":")") + name + "\"}");
+  }
+  std::filesystem::create_directory(directory_.path("config"));
+  observe(directory_.path("config"));
+  EXPECT_EQ(delegate_->next(kQuiet), "none");
+  std::filesystem::remove(directory_.path("config"));
+  std::filesystem::create_directory_symlink("a", directory_.path("config"));
+  EXPECT_EQ(delegate_->next(), "a");
+  std::filesystem::create_directory_symlink("b", directory_.path("link"));
+  std::filesystem::rename(directory_.path("link"), directory_.path("config"));
+  EXPECT_EQ(delegate_->next(), "b");
+  std::filesystem::remove(directory_.path("config"));
+  EXPECT_EQ(delegate_->next(), "absent");
+  std::filesystem::rename(directory_.path("c"), directory_.path("config"));
+  EXPECT_EQ(delegate_->next(), "c");
+  directory_.write(std::string("config/") + kFile, R"({"v":"in c"})");
+  EXPECT_EQ(delegate_->next(), "in c");
+}
+
+TEST_F(FileConfigurationServiceTest, WhatIsNoConfigurationIsAbsent) {
+  const std::string file = directory_.path(kFile);
+  const struct {
+    const char* what;
+    std::function<void()> arrange;
+  } cases[] = {
+      {"empty", [&] { directory_.write(kFile, ""); }},
+      {"over 1 MiB",
+       [&] {
+         directory_.write(
+             kFile,
+             "{\"v\":\"" + std::string(FileConfigurationService::kMaxFileBytes, 'x') + "\"}");
+       }},
+      {"nested", [&] { directory_.write(kFile, std::string(5000, '[') + std::string(5000, ']')); }},
+      {"a directory", [&] { std::filesystem::create_directory(file); }},
+      {"a pipe", [&] { ASSERT_EQ(mkfifo(file.c_str(), 0600), 0); }},
+      {"a link to itself", [&] { ASSERT_EQ(symlink(file.c_str(), file.c_str()), 0); }},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    std::filesystem::remove_all(file);
+    c.arrange();
+    observe();
+    EXPECT_EQ(delegate_->next(), "absent");
+  }
+}
+
+TEST_F(FileConfigurationServiceTest, ADroppedObserverLeavesNoThreadAndNoDescriptor) {
+  const auto entries = [](const char* path) {
+    return std::distance(std::filesystem::directory_iterator(path),
+                         std::filesystem::directory_iterator());
+  };
+  directory_.write(kFile, R"({"v":"one"})");
+  observe();
+  EXPECT_EQ(delegate_->next(), "one");
+  const auto descriptors = entries("/proc/self/fd");
+  for (int i = 0; i < 1000; ++i) {
+    observe();
+    ASSERT_EQ(delegate_->next(), "one");
+  }
+  // The last observer stands for the first; the others' threads end on their own.
+  const auto deadline = std::chrono::steady_clock::now() + kDeadline;
+  while (entries("/proc/self/fd") > descriptors && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::yield();
+  }
+  EXPECT_EQ(entries("/proc/self/fd"), descriptors);
+  observer_.reset();
+  while (entries("/proc/self/task") > 2 && std::chrono::steady_clock::now() < deadline)
+    std::this_thread::yield();
+  EXPECT_LE(entries("/proc/self/task"), 2) << "the main thread and at most the queue's";
+}
+
+TEST_F(FileConfigurationServiceTest, ACallThatIsOnTheQueueOutlivesTheObserver) {
+  directory_.write(kFile, R"({"v":"one"})");
+  Semaphore blocked(0);
+  queue_->async([&blocked] { blocked.waitFor(kDeadline); });
+  observe();
+  const std::weak_ptr<ConfigurationObserver> watched = observer_;
+  // The watching thread has submitted its call once it holds on to the observer.
+  while (watched.use_count() < 2) std::this_thread::yield();
+  observer_.reset();
+  blocked.signal();
+  EXPECT_EQ(delegate_->next(), "one");
+}
+
+}  // namespace
+}  // namespace tessel

@@ -1,0 +1,314 @@
+// compare: what another setting would report that this one does not, and the other way round.
+
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <algorithm>
+#include <map>
+#include <memory>
+#include <tuple>
+
+#include "linux/SystemClock.h"
+#include "tesselctl/commands/ReadingOptions.h"
+#include "tesselctl/judging/Tally.h"
+#include "tesselctl/showing/JsonLine.h"
+#include "tesselctl/showing/Progress.h"
+#include "tesselctl/showing/ShownText.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+struct CompareOptions {
+  ReadingOptions reading;
+  std::string settings[2];
+  bool json = false;
+};
+
+// One side of the comparison.
+struct Setting {
+  Judge judge;
+  Period period;
+};
+
+// Reads "Quarro,internal,last=24h"; a word that makes no sense is said and answered with nothing.
+std::optional<Setting> settingOf(const std::string& words, const Reading& usual, Date now) {
+  Setting setting{usual.judge, usual.period};
+  PeriodArguments period;
+  for (size_t begin = 0; begin <= words.size();) {
+    const size_t end = std::min(words.find(',', begin), words.size());
+    const std::string word = words.substr(begin, end - begin);
+    begin = end + 1;
+    if (word == "usual") continue;
+    if (word == "internal" || word == "no-internal") {
+      setting.judge.internal = word == "internal";
+    } else if (const auto platform = platformNamed(word)) {
+      setting.judge.platform = *platform;
+    } else if (word.starts_with("since=")) {
+      period.since = word.substr(6);
+    } else if (word.starts_with("until=")) {
+      period.until = word.substr(6);
+    } else if (word.starts_with("last=")) {
+      period.last = word.substr(5);
+    } else {
+      fail(kUsage, "'" + word + "' is no setting; settings are usual, internal, no-internal, " +
+                       kPlatformNames + ", since=DATE, until=DATE, last=DURATION");
+      return {};
+    }
+  }
+  if (!period.given()) return setting;
+  const PeriodResult result = periodOf(period, now);
+  if (!result.period) {
+    fail(kUsage, "setting '" + words + "': " + result.error);
+    return {};
+  }
+  setting.period = *result.period;
+  return setting;
+}
+
+// Trace points that one side reports and the other does not, for one reason.
+struct Change {
+  bool starts = false;  // reported by the second side alone
+  std::string subsystem;
+  std::string category;
+  std::string name;
+  std::string why;  // the other side's verdict; "not_recorded" where it has none
+  uint8_t slot = 0;
+  std::string value;  // that the whitelist of the other side does not know
+
+  // NOLINTNEXTLINE(modernize-use-nullptr): the 0 is the compiler's own
+  auto operator<=>(const Change&) const = default;
+};
+
+// Grows with the distinct changes up to a limit; further ones are counted.
+class Changes {
+ public:
+  static constexpr size_t kMost = 8192;
+
+  void add(const Change& change, uint64_t count) {
+    (change.starts ? starting_ : stopping_) += count;
+    const auto known = counts_.find(change);
+    if (known != counts_.end()) {
+      known->second += count;
+    } else if (counts_.size() < kMost) {
+      counts_.emplace(change, count);
+    } else {
+      notListed_ += count;
+    }
+  }
+  std::vector<std::pair<Change, uint64_t>> listed() const {
+    std::vector<std::pair<Change, uint64_t>> changes(counts_.begin(), counts_.end());
+    std::stable_sort(changes.begin(), changes.end(), [](const auto& a, const auto& b) {
+      return std::make_pair(!a.first.starts, b.second) < std::make_pair(!b.first.starts, a.second);
+    });
+    return changes;
+  }
+  uint64_t starting() const { return starting_; }
+  uint64_t stopping() const { return stopping_; }
+  uint64_t notListed() const { return notListed_; }
+
+ private:
+  std::map<Change, uint64_t> counts_;
+  uint64_t starting_ = 0;
+  uint64_t stopping_ = 0;
+  uint64_t notListed_ = 0;
+};
+
+std::string textOf(StringRef text) { return std::string(text.textOr("")); }
+
+// What two settings make of a store.
+struct Comparison {
+  VerdictCounts sides[2] = {};
+  Changes changes;
+  std::optional<PlatformError> error;
+  StoreReport store;
+};
+
+// Both judge each object of one period.
+void compareJudges(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
+  JudgingFilter judges[2] = {JudgingFilter(settings[0].judge), JudgingFilter(settings[1].judge)};
+  DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
+    const FilterDecision decisions[2] = {judges[0].filter().inspectTesselObject(object),
+                                         judges[1].filter().inspectTesselObject(object)};
+    for (size_t side = 0; side < 2; ++side)
+      ++comparison.sides[side][decisions[side].classification];
+    if (decisions[0].shouldReport() == decisions[1].shouldReport()) return true;
+    const bool starts = decisions[1].shouldReport();
+    const FilterDecision& held = decisions[starts ? 0 : 1];
+    comparison.changes.add(
+        {starts, textOf(object.subsystem()), textOf(object.category()), textOf(object.name()),
+         std::string(verdictName(held.classification)), held.stringSlot, textOf(held.stringValue)},
+        1);
+    return true;
+  });
+  ProgressBar bar(true);
+  comparison.error = run.read(settings[0].period,
+                              [&](double part, uint64_t entries) { bar.update(part, entries); });
+  comparison.store = run.report().store;
+}
+
+// Trace points of one kind in each of two periods.
+struct PathFigures {
+  VerdictCounts sides[2] = {};
+};
+using Path = std::tuple<std::string, std::string, std::string>;
+
+constexpr size_t kMaxPaths = 65536;
+
+// The verdict that held back most; the empty name where nothing was recorded.
+std::string mainReason(const VerdictCounts& counts) {
+  if (sumOf(counts) == 0) return "not_recorded";
+  auto main = kVerdictOrder[1];
+  for (const auto verdict : kVerdictOrder) {
+    if (verdict != TesselReporterClassificationTelemetryReported && counts[verdict] > counts[main])
+      main = verdict;
+  }
+  return std::string(verdictName(main));
+}
+
+// Objects of two periods are different ones: what is compared is which trace points are reported.
+void comparePeriods(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
+  std::map<Path, PathFigures> paths;
+  for (size_t side = 0; side < 2 && !comparison.error; ++side) {
+    JudgingFilter judge(settings[side].judge);
+    DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
+      const auto verdict = judge.filter().inspectTesselObject(object).classification;
+      ++comparison.sides[side][verdict];
+      Path path(textOf(object.subsystem()), textOf(object.category()), textOf(object.name()));
+      const auto known = paths.find(path);
+      if (known != paths.end()) {
+        ++known->second.sides[side][verdict];
+      } else if (paths.size() < kMaxPaths) {
+        ++paths[std::move(path)].sides[side][verdict];
+      }
+      return true;
+    });
+    ProgressBar bar(true);
+    comparison.error = run.read(settings[side].period, [&](double part, uint64_t entries) {
+      bar.update((part + static_cast<double>(side)) / 2, entries);
+    });
+    comparison.store = run.report().store;
+  }
+  for (const auto& [path, figures] : paths) {
+    const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];
+    const uint64_t after = figures.sides[1][TesselReporterClassificationTelemetryReported];
+    if ((before == 0) == (after == 0)) continue;
+    const bool starts = before == 0;
+    comparison.changes.add({starts, std::get<0>(path), std::get<1>(path), std::get<2>(path),
+                            mainReason(figures.sides[starts ? 0 : 1]), 0, ""},
+                           starts ? after : before);
+  }
+}
+
+void writeChange(std::string& out, const std::pair<Change, uint64_t>& counted) {
+  const Change& change = counted.first;
+  JsonObject object(out);
+  object.text("change", change.starts ? "start" : "stop")
+      .text("subsystem", std::string_view(change.subsystem))
+      .text("category", std::string_view(change.category))
+      .text("name", std::string_view(change.name))
+      .count("count", counted.second)
+      .text("rule", std::string_view(change.why));
+  if (change.slot != 0)
+    object.count("slot", change.slot).text("value", std::string_view(change.value));
+  object.end();
+}
+
+std::string comparisonJson(const Comparison& comparison) {
+  std::string out;
+  JsonObject object(out);
+  for (size_t side = 0; side < 2; ++side) {
+    object.nested(side == 0 ? "a" : "b", [&](std::string& inner) {
+      JsonObject counts(inner);
+      for (const auto verdict : kVerdictOrder)
+        counts.count(verdictName(verdict), comparison.sides[side][verdict]);
+      counts.end();
+    });
+  }
+  object.count("starts", comparison.changes.starting())
+      .count("stops", comparison.changes.stopping());
+  object.array("changes", comparison.changes.listed(), writeChange);
+  object.count("changes_not_listed", comparison.changes.notListed()).end();
+  return out + "\n";
+}
+
+std::string comparisonText(const Comparison& comparison, const CompareOptions& options) {
+  const Terminal terminal = terminalBehind(STDOUT_FILENO);
+  Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
+  for (const auto verdict : kVerdictOrder) {
+    sums.add({std::string(verdictName(verdict)), grouped(comparison.sides[0][verdict]),
+              grouped(comparison.sides[1][verdict])});
+  }
+  Table table({{"CHANGE"},
+               {"OBJECTS", Table::Align::right},
+               {"TRACE POINT", Table::Align::left, true},
+               {"RULE OF THE OTHER SIDE", Table::Align::left, true}});
+  for (const auto& [change, count] : comparison.changes.listed()) {
+    std::string rule = change.why;
+    if (change.slot != 0) rule += " \"" + terminalText(change.value) + "\"";
+    table.add({{change.starts ? "starts" : "stops", change.starts ? Colour::good : Colour::caution},
+               grouped(count),
+               terminalText(change.subsystem) + " / " + terminalText(change.category) + " / " +
+                   terminalText(change.name),
+               rule});
+  }
+  std::string out = "A: " + terminalText(options.settings[0]) +
+                    "\nB: " + terminalText(options.settings[1]) + "\n\n" +
+                    sums.render(terminal, 2) + "\n" +
+                    wrapped("B would start to report " +
+                                counted(comparison.changes.starting(), "object", "objects") +
+                                " and stop to report " +
+                                counted(comparison.changes.stopping(), "object", "objects") + ".",
+                            terminal.width, 2) +
+                    "\n";
+  if (!table.empty()) out += "\n" + table.render(terminal, 2);
+  return out;
+}
+
+int runCompare(const CompareOptions& options) {
+  const auto launch = launchConfiguration();
+  if (!launch) return kUsage;
+  const Date now = SystemClock().now();
+  const auto reading = readingOf(options.reading, *launch, now);
+  if (!reading) return kUsage;
+  const auto a = settingOf(options.settings[0], *reading, now);
+  const auto b = a ? settingOf(options.settings[1], *reading, now) : std::nullopt;
+  if (!b) return kUsage;
+  const Setting settings[2] = {*a, *b};
+  const bool samePeriod = a->period.start == b->period.start && a->period.end == b->period.end;
+  Comparison comparison;
+  (samePeriod ? compareJudges : comparePeriods)(settings, *reading, comparison);
+  if (comparison.error) return failToRead(comparison.error->localizedDescription, reading->store);
+  print(options.json ? comparisonJson(comparison) : comparisonText(comparison, options));
+  std::fflush(stdout);
+  return warnOfUnreadFiles(comparison.store, reading->store, kDone);
+}
+
+}  // namespace
+
+void addCompareCommand(CLI::App& app, Invocation& invocation) {
+  const auto options = std::make_shared<CompareOptions>();
+  CLI::App* command =
+      app.add_subcommand("compare", "Say what would start and what would stop being reported");
+  command->add_option("A", options->settings[0], "Setting to start from")
+      ->required()
+      ->type_name("");
+  command->add_option("B", options->settings[1], "Setting to compare with it")
+      ->required()
+      ->type_name("");
+  addPeriodOptions(*command, options->reading);
+  command->add_flag("--json", options->json, "One JSON object: a, b, starts, stops, changes");
+  command->footer(
+      "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
+      "no-internal, a platform (Quarro, Selvin, Darrow, Fennic, Lumet), since=DATE, until=DATE,\n"
+      "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
+      "trace\n"
+      "points are compared that are reported at all.\n\n"
+      "Examples:\n"
+      "  tesselctl compare usual internal\n"
+      "  tesselctl compare Selvin Quarro,internal --last 7d\n"
+      "  tesselctl compare since=yesterday,until=today since=today");
+  command->callback([&invocation, options] { invocation.status = runCompare(*options); });
+}
+
+}  // namespace tessel::ctl

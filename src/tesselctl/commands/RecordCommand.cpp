@@ -1,0 +1,270 @@
+// tesselctl record: writes trace points to the journal or to a store of its own.
+
+#include <spawn.h>
+#include <sys/wait.h>
+
+#include <cerrno>
+#include <csignal>
+#include <memory>
+#include <system_error>
+
+#include "journal/EntryCursor.h"
+#include "journal/ExportFile.h"
+#include "journal/JournalSocket.h"
+#include "tesselctl/commands/Commands.h"
+#include "tesselctl/reading/RecordedPoint.h"
+
+extern char** environ;
+
+namespace tessel::ctl {
+
+namespace {
+
+constexpr const char* kDescription =
+    "Record a trace point: an event, the begin or the end of an interval, or an interval around a "
+    "command";
+
+constexpr const char* kFooter =
+    "Examples:\n"
+    "  tesselctl record event com.vantor.Calendar View Open --telemetry --string1 period=week\n"
+    "  tesselctl record begin com.vantor.Render Frame Draw --id 7\n"
+    "  tesselctl record end   com.vantor.Render Frame Draw --id 7 --frame-rate 59.9\n"
+    "  tesselctl record --subsystem com.vantor.Backup --category Job -- rsync -a /home "
+    "/mnt\n\n"
+    "A begin and its end match on subsystem, category, name and --id, and in process scope on the\n"
+    "process. 'record begin' and 'record end' are two processes, so their scope is 'system' "
+    "unless\n"
+    "--scope says otherwise. 'record -- COMMAND' exits with the status of the command, 128 and "
+    "the\n"
+    "number of the signal that killed it, 127 where it is not found.";
+
+// What in --store mode stands in for what the journal daemon would have seen.
+struct OriginOptions {
+  std::optional<uint64_t> at, monotonic;
+  std::optional<double> ago;
+  std::optional<std::string> imagePath, processName, process, boot;
+
+  bool any() const { return at || monotonic || ago || imagePath || processName || process || boot; }
+};
+
+struct RecordOptions {
+  RecordedPoint point;
+  OriginOptions origin;
+  std::optional<std::string> store;
+};
+
+// Thrown nowhere: an error and the status that goes with it.
+struct Failure {
+  ExitStatus status;
+  std::string message;
+};
+
+// Moves the monotonic time along with the time; nothing where that would be before the boot.
+std::optional<uint64_t> movedMonotonic(const RecordOrigin& now, uint64_t realtime) {
+  const auto distance = static_cast<int64_t>(realtime - now.realtime);
+  if (distance < 0 && now.monotonic < static_cast<uint64_t>(-distance)) return std::nullopt;
+  return now.monotonic + static_cast<uint64_t>(distance);
+}
+
+std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
+  const RecordOrigin now = currentOrigin();
+  RecordOrigin origin = now;
+  if (options.at) origin.realtime = *options.at;
+  if (options.ago) origin.realtime -= static_cast<uint64_t>(*options.ago * 1e6);
+  if (options.boot) {
+    const auto boot = parseId128(*options.boot);
+    if (!boot)
+      return Failure{kUsage, "'" + *options.boot + "' is no boot id: 32 hexadecimal digits"};
+    origin.boot = *boot;
+  }
+  // A made-up boot counts its time from 1970, so that distances within it are right.
+  const std::optional<uint64_t> monotonic = options.monotonic ? options.monotonic
+                                            : options.boot    ? std::optional(origin.realtime)
+                                                           : movedMonotonic(now, origin.realtime);
+  if (!monotonic) {
+    return Failure{kUsage, "the time is before this machine's boot: give --boot, or --monotonic"};
+  }
+  origin.monotonic = *monotonic;
+  if (options.imagePath) origin.imagePath = options.imagePath;
+  if (options.processName) origin.processName = options.processName;
+  if (options.process) origin.process = options.process;
+  for (auto* text : {&origin.imagePath, &origin.processName, &origin.process}) {
+    if (*text && (*text)->empty()) text->reset();
+  }
+  return origin;
+}
+
+std::optional<Failure> record(const RecordOptions& options, const std::string& kind) {
+  if (!options.store && options.origin.any()) {
+    return Failure{kUsage,
+                   "--at, --ago, --monotonic, --boot, --exe, --comm and --pid need --store"};
+  }
+  auto fields = fieldsOf(options.point, kind);
+  if (auto* complaint = std::get_if<std::string>(&fields)) return Failure{kUsage, *complaint};
+  const auto& list = std::get<std::vector<RecordedField>>(fields);
+  std::optional<PlatformError> error;
+  if (options.store) {
+    auto origin = originOf(options.origin);
+    if (auto* failure = std::get_if<Failure>(&origin)) return *failure;
+    error = appendToExportFile(*options.store, std::get<RecordOrigin>(origin), list);
+  } else {
+    error = sendToJournal(list);
+    if (error) error->localizedDescription += " (--store DIR records without a journal)";
+  }
+  if (error) return Failure{kNoAccess, error->localizedDescription};
+  return std::nullopt;
+}
+
+int exitStatusOf(int waitStatus) {
+  return WIFEXITED(waitStatus) ? WEXITSTATUS(waitStatus) : 128 + WTERMSIG(waitStatus);
+}
+
+// Runs the command to its end; what the terminal sends to both of us is for the command.
+int runCommand(const std::vector<std::string>& command) {
+  std::vector<char*> arguments;
+  arguments.reserve(command.size() + 1);
+  for (const std::string& argument : command)
+    arguments.push_back(const_cast<char*>(argument.c_str()));
+  arguments.push_back(nullptr);
+  sigset_t defaults;
+  sigemptyset(&defaults);
+  sigaddset(&defaults, SIGINT);
+  sigaddset(&defaults, SIGQUIT);
+  posix_spawnattr_t attributes;
+  posix_spawnattr_init(&attributes);
+  posix_spawnattr_setsigdefault(&attributes, &defaults);
+  posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGDEF);
+  std::signal(SIGINT, SIG_IGN);
+  std::signal(SIGQUIT, SIG_IGN);
+  pid_t child = 0;
+  const int error =
+      ::posix_spawnp(&child, arguments[0], nullptr, &attributes, arguments.data(), environ);
+  posix_spawnattr_destroy(&attributes);
+  if (error != 0) {
+    fail(kBad, command[0] + ": " + std::generic_category().message(error));
+    return error == ENOENT ? 127 : 126;
+  }
+  int status = 0;
+  while (::waitpid(child, &status, 0) < 0 && errno == EINTR) {
+  }
+  return exitStatusOf(status);
+}
+
+int recordAround(const RecordOptions& options, const std::vector<std::string>& command) {
+  if (const auto failure = record(options, "begin")) return fail(failure->status, failure->message);
+  const int status = runCommand(command);
+  // The command has done its work; that its end is not recorded does not change what it answered.
+  if (const auto failure = record(options, "end")) fail(failure->status, failure->message);
+  return status;
+}
+
+int recordPoint(RecordOptions& options, const std::string& kind) {
+  if (kind != "event" && !options.point.scope) options.point.scope = "system";
+  const auto failure = record(options, kind);
+  return failure ? fail(failure->status, failure->message) : kDone;
+}
+
+void addPointOptions(CLI::App& app, RecordedPoint& point) {
+  app.add_flag("--telemetry", point.telemetry,
+               "Mark it for telemetry; what is not marked is never reported");
+  app.add_option("--string1", point.strings[0], "First labelled string")->type_name("LABEL=VALUE");
+  app.add_option("--string2", point.strings[1], "Second labelled string")->type_name("LABEL=VALUE");
+  app.add_option("--number1", point.numbers[0], "First labelled number, decimal")
+      ->type_name("LABEL=VALUE");
+  app.add_option("--number2", point.numbers[1], "Second labelled number, decimal")
+      ->type_name("LABEL=VALUE");
+  app.add_option("--duration", point.duration, "Duration to state in place of the measured one")
+      ->type_name("SECONDS");
+  app.add_option("--frame-rate", point.frameRate,
+                 "Frames per second; makes it an animation interval")
+      ->type_name("RATE");
+  app.add_option("--id", point.id, "Which begin an end belongs to, where several are open")
+      ->type_name("ID");
+  app.add_option("--scope", point.scope, "Whether begin and end come from one process")
+      ->check(CLI::IsMember({"process", "system"}));
+  app.add_option("--attribute", point.attributes, "Attribute of an interval; may be repeated")
+      ->type_name("KEY=VALUE")
+      ->allow_extra_args(false);
+  app.add_option("--field", point.fields, "Any other journal field; may be repeated")
+      ->type_name("NAME=VALUE")
+      ->allow_extra_args(false);
+  app.add_option("--message", point.message, "Text of the journal entry")->capture_default_str();
+}
+
+void addStoreOptions(CLI::App& app, RecordOptions& options) {
+  const std::string group = "With --store, in place of what is true";
+  OriginOptions& origin = options.origin;
+  app.add_option("--store", options.store,
+                 "Append to an .export file in this directory instead of the journal; for machines "
+                 "without a journal, and for trying things out")
+      ->type_name("DIR");
+  const auto add = [&](const char* name, auto& value, const char* type, const char* help) {
+    return app.add_option(name, value, help)->type_name(type)->group(group);
+  };
+  auto* at = add("--at", origin.at, "MICROSECONDS", "Time of the entry, since 1970");
+  add("--ago", origin.ago, "SECONDS", "Time of the entry, before now")
+      ->excludes(at)
+      ->check(CLI::NonNegativeNumber);
+  add("--monotonic", origin.monotonic, "MICROSECONDS", "Time of the entry, since boot");
+  add("--boot", origin.boot, "ID", "Boot, 32 hexadecimal digits");
+  add("--exe", origin.imagePath, "PATH", "Executable of the writer; empty: not known");
+  add("--comm", origin.processName, "NAME", "Name of the writing process; empty: not known");
+  add("--pid", origin.process, "PID", "Id of the writing process; empty: not known");
+}
+
+void addKind(CLI::App& app, Invocation& invocation, RecordOptions& options, const std::string& kind,
+             const std::string& description) {
+  CLI::App* command = app.add_subcommand(kind, description);
+  command->fallthrough();
+  command->footer("The options are those of 'tesselctl record'.");
+  command
+      ->add_option("subsystem", options.point.subsystem, "Subsystem, such as com.vantor.Calendar")
+      ->required();
+  command->add_option("category", options.point.category, "Category within the subsystem")
+      ->required();
+  command->add_option("name", options.point.name, "Name of the trace point");
+  command->callback([&invocation, &options, kind] {
+    invocation.status =
+        invocation.command ? fail(kUsage, "either '" + kind + "' or a command after '--', not both")
+                           : recordPoint(options, kind);
+  });
+}
+
+int recordCommandLine(const CLI::App& app, const Invocation& invocation,
+                      const RecordOptions& options) {
+  if (!invocation.command || invocation.command->empty()) {
+    return fail(kUsage, "record needs event, begin or end, or a command after '--'; see --help");
+  }
+  if (app.count("--subsystem") == 0 || app.count("--category") == 0) {
+    return fail(kUsage, "record around a command needs --subsystem and --category");
+  }
+  return recordAround(options, *invocation.command);
+}
+
+}  // namespace
+
+void addRecordCommand(CLI::App& app, Invocation& invocation) {
+  auto options = std::make_shared<RecordOptions>();
+  CLI::App* record = app.add_subcommand("record", kDescription);
+  record->footer(kFooter);
+  record->require_subcommand(0, 1);
+  addKind(*record, invocation, *options, "event", "One moment");
+  addKind(*record, invocation, *options, "begin", "An interval begins");
+  addKind(*record, invocation, *options, "end", "An interval ends");
+  const std::string group = "Around a command";
+  record->add_option("--subsystem", options->point.subsystem, "Subsystem")
+      ->type_name("TEXT")
+      ->group(group);
+  record->add_option("--category", options->point.category, "Category")
+      ->type_name("TEXT")
+      ->group(group);
+  record->add_option("--name", options->point.name, "Name")->type_name("TEXT")->group(group);
+  addPointOptions(*record, options->point);
+  addStoreOptions(*record, *options);
+  record->final_callback([record, options, &invocation] {
+    if (!record->get_subcommands().empty()) return;
+    invocation.status = recordCommandLine(*record, invocation, *options);
+  });
+}
+
+}  // namespace tessel::ctl

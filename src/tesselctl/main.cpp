@@ -1,0 +1,75 @@
+// tesselctl: the companion of the service on the command line.
+
+#include <algorithm>
+#include <memory>
+
+#include "tesselctl/commands/Commands.h"
+#include "tesselctl/showing/Terminal.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+constexpr const char* kFooter =
+    "Exit status: 0 done; 1 the answer is bad; 2 usage; 4 no access.\n"
+    "'tesselctl COMMAND --help' says more about a command.";
+
+// Help that fits 80 columns.
+class NarrowFormatter final : public CLI::Formatter {
+ public:
+  NarrowFormatter() { column_width(kColumn); }
+  std::string make_option_desc(const CLI::Option* option) const override {
+    return wrapped(option->get_description(), kWidth - kColumn, 0);
+  }
+
+ private:
+  static constexpr size_t kColumn = 28;
+  static constexpr size_t kWidth = 80;
+};
+
+// Takes what stands behind "--" off the arguments.
+std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& arguments) {
+  const auto dashes = std::find(arguments.begin(), arguments.end(), "--");
+  if (dashes == arguments.end()) return std::nullopt;
+  std::vector<std::string> command(dashes + 1, arguments.end());
+  arguments.erase(dashes, arguments.end());
+  return command;
+}
+
+int run(std::vector<std::string> arguments) {
+  Invocation invocation;
+  invocation.command = takeCommand(arguments);
+  CLI::App app("Records trace points and shows what tessel_reporter makes of them.", "tesselctl");
+  app.require_subcommand(1);
+  app.footer(kFooter);
+  app.formatter(std::make_shared<NarrowFormatter>());
+  addRecordCommand(app, invocation);
+  addExplainCommand(app, invocation);
+  addCompareCommand(app, invocation);
+  addEventsCommand(app, invocation);
+  addStatusCommand(app, invocation);
+  addDeferCommand(app, invocation);
+  addTaskingCommand(app, invocation);
+  addReportCommand(app, invocation);
+  if (!arguments.empty() && !arguments[0].starts_with('-') &&
+      app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
+          .empty()) {
+    return fail(kUsage, "there is no command '" + arguments[0] + "'; see tesselctl --help");
+  }
+  std::reverse(arguments.begin(), arguments.end());  // as the parser wants them
+  try {
+    app.parse(std::move(arguments));
+  } catch (const CLI::ParseError& error) {
+    if (app.get_subcommands().empty() && !app.remaining().empty()) {
+      return fail(kUsage, "no command is called '" + app.remaining().front() + "'; see --help");
+    }
+    return app.exit(error) == 0 ? kDone : kUsage;
+  }
+  return invocation.status;
+}
+
+}  // namespace
+
+}  // namespace tessel::ctl
+
+int main(int argc, char** argv) { return tessel::ctl::run({argv + 1, argv + argc}); }

@@ -1,0 +1,181 @@
+// Reading a store as a run does.
+
+#include "tesselctl/reading/DryRun.h"
+
+#include <algorithm>
+#include <thread>
+#include <unordered_map>
+#include <utility>
+
+#include "filter/DefaultDownsampling.h"
+#include "linux/SystemClock.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+constexpr std::chrono::milliseconds kLookInterval{250};
+// Entries of several files and boots come in an order of their own: what is stamped this much
+// before the latest entry may still be new.
+constexpr uint64_t kOverlap = 5'000'000;
+constexpr uint64_t kProgressMask = 0xfff;
+
+// Tells a listener how far another stream is.
+class WatchedStream final : public EntryStream {
+ public:
+  WatchedStream(EntryStream& source, TimeRange range, const DryRun::Progress& progress)
+      : source_(source), range_(range), progress_(progress) {}
+
+  bool next() override {
+    if ((++entries_ & kProgressMask) == 0 && progress_) progress_(part(), entries_);
+    return source_.next();
+  }
+  const EntryHeader& header() const override { return source_.header(); }
+  Entry entry() override { return source_.entry(); }
+
+ private:
+  double part() const {
+    const uint64_t at = std::clamp(source_.header().realtime, range_.start, range_.end);
+    return static_cast<double>(at - range_.start) / static_cast<double>(range_.end - range_.start);
+  }
+
+  EntryStream& source_;
+  const TimeRange range_;
+  const DryRun::Progress& progress_;
+  uint64_t entries_ = 0;
+};
+
+// Passes on what was not passed on in an earlier look. An entry is known by what its header says;
+// where several look the same, by how many there are.
+class NewEntries {
+ public:
+  // From which time on a look must read.
+  uint64_t start() const { return start_; }
+  explicit NewEntries(uint64_t start) : start_(start), latest_(start) {}
+
+  void beginLook() { inThisLook_.clear(); }
+  bool isNew(const EntryHeader& header) {
+    const uint64_t identity = identityOf(header);
+    latest_ = std::max(latest_, header.realtime);
+    const uint32_t number = ++inThisLook_[identity].number;
+    inThisLook_[identity].realtime = header.realtime;
+    const auto known = passedOn_.find(identity);
+    return known == passedOn_.end() || number > known->second.number;
+  }
+  // `now`: what claims to be of the future does not move the window there.
+  void endLook(uint64_t now) {
+    for (const auto& [identity, seen] : inThisLook_) {
+      Seen& known = passedOn_[identity];
+      known.number = std::max(known.number, seen.number);
+      known.realtime = seen.realtime;
+    }
+    const uint64_t reached = std::min(latest_, now);
+    start_ = std::max(start_, reached - std::min(reached, kOverlap));
+    std::erase_if(passedOn_, [this](const auto& seen) { return seen.second.realtime < start_; });
+  }
+
+ private:
+  struct Seen {
+    uint32_t number = 0;
+    uint64_t realtime = 0;
+  };
+  static uint64_t identityOf(const EntryHeader& header) {
+    const uint64_t parts[] = {header.sequenceNumber, header.monotonic, header.realtime,
+                              header.contentHash};
+    std::string bytes(reinterpret_cast<const char*>(parts), sizeof parts);
+    bytes.append(reinterpret_cast<const char*>(header.bootId.data()), header.bootId.size());
+    bytes.append(reinterpret_cast<const char*>(header.sequenceId.data()), header.sequenceId.size());
+    return hashText(bytes);
+  }
+
+  uint64_t start_;
+  uint64_t latest_;
+  std::unordered_map<uint64_t, Seen> passedOn_;
+  std::unordered_map<uint64_t, Seen> inThisLook_;
+};
+
+class NewEntryStream final : public EntryStream {
+ public:
+  NewEntryStream(EntryStream& source, NewEntries& news) : source_(source), news_(news) {}
+
+  bool next() override {
+    while (source_.next()) {
+      if (news_.isNew(source_.header())) return true;
+    }
+    return false;
+  }
+  const EntryHeader& header() const override { return source_.header(); }
+  Entry entry() override { return source_.entry(); }
+
+ private:
+  EntryStream& source_;
+  NewEntries& news_;
+};
+
+uint64_t microsecondsSince1970(Date date) {
+  return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
+}
+
+}  // namespace
+
+JudgingFilter::JudgingFilter(const Judge& judge)
+    : variant_(std::make_unique<FixedVariant>(judge.internal)),
+      filter_(TesselReporterObjectFilter::initWithPlatform(judge.platform, *variant_)) {
+  filter_->setScnFilter(makeDefaultFilterForPlatform(judge.platform));
+}
+
+DryRun::DryRun(std::optional<std::string> store, Visitor visitor)
+    : store_(std::move(store)), visitor_(std::move(visitor)) {
+  const auto visit = [this](const std::shared_ptr<const TesselObject>& object) {
+    refused_ = refused_ || !visitor_(*object, extractor_.currentEntry());
+    return !refused_;
+  };
+  extractor_.setIntervalCompletionProcessingBlock(visit);
+  extractor_.setAnimationIntervalCompletionProcessingBlock(visit);
+  extractor_.setEmitEventProcessingBlock(visit);
+  extractor_.setBuildAnimationCompositeIntervalTimelines(false);
+}
+
+std::optional<PlatformError> DryRun::readOnce(TimeRange range,
+                                              const std::function<void(EntryStream&)>& process) {
+  auto opened = TraceStore::open(store_, range, extractor_.tokenizer(), extractor_.stopFlag());
+  if (auto* error = std::get_if<PlatformError>(&opened)) return std::move(*error);
+  TraceStore& store = *std::get<std::unique_ptr<TraceStore>>(opened);
+  process(store.entries());
+  storeReport_ = store.report();
+  return {};
+}
+
+std::optional<PlatformError> DryRun::read(const Period& period, const Progress& progress) {
+  const TimeRange range{microsecondsSince1970(period.start), microsecondsSince1970(period.end)};
+  return readOnce(range, [&](EntryStream& entries) {
+    WatchedStream watched(entries, range, progress);
+    extractor_.processEntries(watched);
+  });
+}
+
+std::optional<PlatformError> DryRun::follow(Date start,
+                                            const std::function<void()>& afterEachLook) {
+  SystemClock clock;
+  NewEntries news(microsecondsSince1970(start));
+  while (!refused_) {
+    news.beginLook();
+    auto error = readOnce({news.start(), UINT64_MAX}, [&](EntryStream& entries) {
+      NewEntryStream fresh(entries, news);
+      extractor_.processEntries(fresh);
+    });
+    if (error) return error;
+    news.endLook(microsecondsSince1970(clock.now()));
+    afterEachLook();
+    std::this_thread::sleep_for(kLookInterval);
+  }
+  return {};
+}
+
+ExtractionReport DryRun::report() const {
+  ExtractionReport report = extractor_.report();
+  report.store = storeReport_;
+  return report;
+}
+
+}  // namespace tessel::ctl

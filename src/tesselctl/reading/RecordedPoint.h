@@ -1,0 +1,35 @@
+// RecordedPoint: a trace point as it is asked for on the command line, and its journal fields.
+
+#pragma once
+
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "journal/ExportFile.h"
+
+namespace tessel::ctl {
+
+struct RecordedPoint {
+  std::string subsystem;
+  std::string category;
+  std::optional<std::string> name;
+  std::optional<std::string> id;
+  std::optional<std::string> scope;
+  bool telemetry = false;
+  std::optional<std::string> strings[2];  // LABEL=VALUE
+  std::optional<std::string> numbers[2];  // LABEL=VALUE
+  std::optional<std::string> duration;
+  std::optional<std::string> frameRate;
+  std::vector<std::string> attributes;  // KEY=VALUE
+  std::vector<std::string> fields;      // NAME=VALUE, any other field
+  std::string message = "tessel";
+};
+
+// The fields of the entry of kind `kind`, or what is wrong with the point, in words: whatever a
+// reader of the journal would count as malformed, and what the journal would drop without a word.
+std::variant<std::vector<RecordedField>, std::string> fieldsOf(const RecordedPoint& point,
+                                                               const std::string& kind);
+
+}  // namespace tessel::ctl

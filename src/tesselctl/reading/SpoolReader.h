@@ -1,0 +1,69 @@
+// SpoolReader: the analytics spool as somebody beside the service reads it.
+//
+// Reads while the service writes, and follows when the spool is replaced. Never writes; where the
+// reader may not even make SQLite's bookkeeping files, the database is read as it stands.
+// Threads: one at a time.
+
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "statora/ForwarderState.h"
+#include "statora/Sqlite.h"
+
+namespace tessel::ctl {
+
+struct SpoolRow {
+  int64_t id = 0;
+  int64_t time = 0;  // microseconds since 1970
+  std::string_view name;
+  std::string_view payload;
+};
+
+// What a spool holds.
+struct SpoolContents {
+  int64_t rows = 0;
+  std::optional<int64_t> oldest;  // microseconds since 1970; absent where it is empty
+  std::optional<int64_t> newest;
+  uint64_t bytes = 0;                          // database and write-ahead log
+  std::optional<ForwarderCounters> forwarder;  // absent where none ever worked on it
+};
+
+class SpoolReader {
+ public:
+  enum class State { open, absent, noAccess, damaged };
+
+  explicit SpoolReader(const std::string& stateDirectory);
+
+  const std::string& path() const { return path_; }
+  // Opens the spool, or opens it anew where another file stands in its place by now; what was read
+  // of the old one no longer counts then.
+  State open();
+  // Why it is not open, in words.
+  const std::string& reason() const { return reason_; }
+
+  // Calls `visit` with each row behind those of earlier calls, oldest first, until it answers
+  // false. The row is borrowed. False, with a reason, where the spool cannot be read.
+  bool readNew(const std::function<bool(const SpoolRow&)>& visit);
+  // Nothing, with a reason, where the spool cannot be read.
+  std::optional<SpoolContents> contents();
+
+ private:
+  State openDatabase();
+  bool sameFile() const;
+
+  const std::string path_;
+  SqliteDatabase database_;
+  dev_t device_ = 0;
+  ino_t inode_ = 0;
+  int64_t lastId_ = 0;
+  std::string reason_;
+};
+
+}  // namespace tessel::ctl

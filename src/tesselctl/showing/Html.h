@@ -1,0 +1,50 @@
+// Html: markup that is put together piece by piece and cannot be injected into.
+//
+// Only literals of this program are markup; every other text is escaped on its way in, whoever
+// wrote it. One thread at a time.
+
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "tesselctl/showing/ShownText.h"
+
+namespace tessel::ctl {
+
+class Html {
+ public:
+  template <size_t N>
+  Html& operator<<(const char (&markup)[N]) {
+    text_.append(markup, N - 1);
+    return *this;
+  }
+  Html& operator<<(std::string_view text) {
+    text_ += htmlText(text);
+    return *this;
+  }
+  Html& operator<<(const std::string& text) { return *this << std::string_view(text); }
+  // A count, in groups of three digits for people and plain for programs.
+  Html& operator<<(uint64_t count) {
+    text_.append("<data value=\"")
+        .append(std::to_string(count))
+        .append("\">")
+        .append(grouped(count))
+        .append("</data>");
+    return *this;
+  }
+  Html& operator<<(const Html& part) {
+    text_ += part.text_;
+    return *this;
+  }
+  // A coordinate or a size in a drawing.
+  Html& at(double value);
+
+  const std::string& text() const { return text_; }
+
+ private:
+  std::string text_;
+};
+
+}  // namespace tessel::ctl

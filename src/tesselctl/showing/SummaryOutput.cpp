@@ -1,0 +1,271 @@
+// The figures of a dry run as JSON and as tables.
+
+#include <algorithm>
+#include <nlohmann/json.hpp>
+
+#include "linux/ReadingDigest.h"
+#include "tesselctl/judging/Losses.h"
+#include "tesselctl/judging/Tally.h"
+#include "tesselctl/showing/JsonLine.h"
+#include "tesselctl/showing/ShownText.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+constexpr size_t kShownPairs = 20;
+constexpr size_t kShownMisses = 20;
+
+std::string share(uint64_t part, uint64_t whole) {
+  if (whole == 0 || part == 0) return "";
+  const uint64_t permille = (part * 1000 + whole / 2) / whole;
+  return std::to_string(permille / 10) + "." + std::to_string(permille % 10) + " %";
+}
+
+void writeVerdicts(JsonObject& object, const VerdictCounts& counts) {
+  for (const auto verdict : kVerdictOrder) object.count(verdictName(verdict), counts[verdict]);
+}
+
+void writePair(std::string& out, const Tally::Pair& pair) {
+  JsonObject object(out);
+  object.text("subsystem", std::string_view(pair.subsystem))
+      .text("category", std::string_view(pair.category));
+  writeVerdicts(object, pair.counts);
+  object.end();
+}
+
+void writeMiss(std::string& out, const Tally::Miss& miss) {
+  JsonObject object(out);
+  object.text("subsystem", std::string_view(miss.subsystem))
+      .text("category", std::string_view(miss.category))
+      .text("name", std::string_view(miss.name))
+      .count("slot", miss.slot)
+      .text("value", std::string_view(miss.value))
+      .count("count", miss.count)
+      .end();
+}
+
+void writeProblem(std::string& out, const FileProblem& problem) {
+  JsonObject(out)
+      .text("reason", std::string_view(problem.reason))
+      .count("count", problem.count)
+      .count("first_place", problem.firstPlace)
+      .end();
+}
+
+void writeFile(std::string& out, const FileReport& file) {
+  JsonObject object(out);
+  object.text("path", std::string_view(file.path)).count("entries_read", file.entriesRead);
+  if (file.skipped) object.text("skipped", std::string_view(*file.skipped));
+  object.array("problems", file.problems, writeProblem).end();
+}
+
+void writeKinds(std::string& out, const Tally& tally) {
+  JsonObject object(out);
+  for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
+    object.nested(Tally::kKinds[kind], [&](std::string& inner) {
+      JsonObject(inner)
+          .count("reported", tally.kinds()[kind].reported)
+          .count("unreported", tally.kinds()[kind].unreported)
+          .end();
+    });
+  }
+  object.end();
+}
+
+void writeIntervals(std::string& out, const AssemblyCounts& counts) {
+  JsonObject(out)
+      .count("unmatched_ends", counts.unmatchedEnds)
+      .count("replaced_begins", counts.replacedBegins)
+      .count("open", counts.openIntervals)
+      .count("dropped", counts.droppedOpenIntervals)
+      .end();
+}
+
+std::string verdictTable(const Tally& tally, const Terminal& terminal) {
+  Table table({{"VERDICT"},
+               {"OBJECTS", Table::Align::right},
+               {"", Table::Align::right},
+               {"MEANING", Table::Align::left, true}});
+  for (const auto verdict : kVerdictOrder) {
+    const uint64_t count = tally.verdicts()[verdict];
+    if (count == 0 && verdict == TesselReporterClassificationClassNotSupported) continue;
+    table.add(
+        {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
+         grouped(count),
+         share(count, tally.traceObjects()),
+         std::string(verdictMeaning(verdict))});
+  }
+  return table.render(terminal, 2);
+}
+
+std::string kindTable(const Tally& tally, const Terminal& terminal) {
+  Table table({{"KIND"}, {"REPORTED", Table::Align::right}, {"NOT REPORTED", Table::Align::right}});
+  for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
+    const KindCounts& counts = tally.kinds()[kind];
+    table.add(
+        {std::string(Tally::kKinds[kind]), grouped(counts.reported), grouped(counts.unreported)});
+  }
+  return table.render(terminal, 2);
+}
+
+std::string more(size_t listed, size_t all, std::string_view what) {
+  if (all <= listed) return {};
+  return "  ... and " + grouped(all - listed) + " more " + std::string(what) +
+         " (--json lists all)\n";
+}
+
+struct PairColumn {
+  const char* title;
+  std::vector<TesselReporterClassification> verdicts;
+
+  uint64_t count(const VerdictCounts& counts) const {
+    uint64_t sum = 0;
+    for (const auto verdict : verdicts) sum += counts[verdict];
+    return sum;
+  }
+};
+
+// The columns that are not zero throughout; what is reported is always shown.
+std::vector<PairColumn> pairColumns(const VerdictCounts& all) {
+  std::vector<PairColumn> columns = {
+      {"REPORTED", {TesselReporterClassificationTelemetryReported}},
+      {"DISABLED", {TesselReporterClassificationTelemetryDisabled}},
+      {"UNKNOWN", {TesselReporterClassificationFailedStringWhitelist}},
+      {"THINNED", {TesselReporterClassificationFailedSCFilter}},
+      {"OTHER",
+       {TesselReporterClassificationDurationThreshold,
+        TesselReporterClassificationClassNotSupported}}};
+  std::erase_if(columns, [&](const PairColumn& column) {
+    return column.verdicts.front() != TesselReporterClassificationTelemetryReported &&
+           column.count(all) == 0;
+  });
+  return columns;
+}
+
+std::string pairTable(const Tally& tally, const Terminal& terminal) {
+  const auto counted = pairColumns(tally.verdicts());
+  std::vector<Table::Column> columns = {{"SUBSYSTEM", Table::Align::left, true},
+                                        {"CATEGORY", Table::Align::left, true}};
+  for (const PairColumn& column : counted) columns.push_back({column.title, Table::Align::right});
+  Table table(std::move(columns));
+  const auto pairs = tally.pairs();
+  for (size_t at = 0; at < std::min(pairs.size(), kShownPairs); ++at) {
+    std::vector<Table::Cell> row = {terminalText(pairs[at].subsystem),
+                                    terminalText(pairs[at].category)};
+    for (const PairColumn& column : counted)
+      row.emplace_back(grouped(column.count(pairs[at].counts)));
+    table.add(std::move(row));
+  }
+  return table.render(terminal, 2) + more(kShownPairs, pairs.size(), "pairs");
+}
+
+std::string missTable(const Tally& tally, const Terminal& terminal) {
+  Table table({{"TIMES", Table::Align::right},
+               {"VALUE", Table::Align::left, true},
+               {"STRING"},
+               {"TRACE POINT", Table::Align::left, true}});
+  const auto misses = tally.misses();
+  for (size_t at = 0; at < std::min(misses.size(), kShownMisses); ++at) {
+    const Tally::Miss& miss = misses[at];
+    table.add({grouped(miss.count), "\"" + terminalText(miss.value) + "\"",
+               std::to_string(miss.slot),
+               terminalText(miss.subsystem) + " / " + terminalText(miss.category) + " / " +
+                   terminalText(miss.name)});
+  }
+  std::string out = table.render(terminal, 2) + more(kShownMisses, misses.size(), "values");
+  if (tally.missesNotListed() != 0) {
+    out += "  " + counted(tally.missesNotListed(), "object", "objects") + " had further values\n";
+  }
+  return out;
+}
+
+void addLosses(Table& table, const std::vector<Loss>& losses) {
+  for (const Loss& loss : losses) table.add({grouped(loss.count), terminalText(loss.what)});
+}
+
+std::string lossLines(const ExtractionReport& report, const Terminal& terminal) {
+  const AssemblyCounts& counts = report.assembly;
+  Table table({{"ENTRIES", Table::Align::right}, {"WHY NO TRACE OBJECT CAME OF THEM"}});
+  addLosses(table, entryLosses(malformedCounts(report), counts.droppedOpenIntervals,
+                               report.beyondPairLimit));
+  addLosses(table, thoseThatOccurred({
+                       {counts.unmatchedEnds, "an end whose begin was not read"},
+                       {counts.replacedBegins, "a begin that was replaced by a second one"},
+                       {counts.openIntervals, "a begin that waits for its end"},
+                   }));
+  return table.empty() ? "" : "\n" + table.render(terminal, 2);
+}
+
+// What the store itself has lost or never had; empty where nothing is missing.
+std::string storeLines(const ExtractionReport& report, const Terminal& terminal) {
+  const std::string part = partOfPeriod(report.store);
+  Table table(
+      {{"NUMBER", Table::Align::right}, {"WHAT THE STORE LACKS", Table::Align::left, true}});
+  addLosses(table, storeLosses(report.store, report.assembly.withoutImagePath));
+  return (part.empty() ? "" : "\n" + part + ".\n") +
+         (table.empty() ? "" : "\n" + table.render(terminal, 2));
+}
+
+std::string fileLines(const StoreReport& store, const Terminal& terminal) {
+  Table table({{"PROBLEM", Table::Align::left, true},
+               {"TIMES", Table::Align::right},
+               {"FILE", Table::Align::left, true}});
+  for (const FileReport& file : store.files) {
+    if (file.skipped && !file.outsideRange)
+      table.add({terminalText(whyNotRead(file)), "", terminalText(file.path)});
+    for (const FileProblem& problem : file.problems) {
+      table.add({terminalText(problem.reason), grouped(problem.count), terminalText(file.path)});
+    }
+  }
+  return table.empty() ? "" : "\n" + table.render(terminal, 2);
+}
+
+}  // namespace
+
+std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
+  std::string out;
+  JsonObject object(out);
+  object.count("log_events", report.entriesRead).count("trace_objects", tally.traceObjects());
+  object.nested("verdicts", [&](std::string& inner) {
+    JsonObject verdicts(inner);
+    writeVerdicts(verdicts, tally.verdicts());
+    verdicts.end();
+  });
+  object.nested("kinds", [&](std::string& inner) { writeKinds(inner, tally); });
+  object.array("pairs", tally.pairs(), writePair);
+  object.nested("malformed", [&](std::string& inner) {
+    JsonObject malformed(inner);
+    for (const auto& [reason, count] : malformedCounts(report)) malformed.count(reason, count);
+    malformed.end();
+  });
+  object.array("whitelist_misses", tally.misses(), writeMiss);
+  object.count("whitelist_misses_not_listed", tally.missesNotListed());
+  object.nested("intervals", [&](std::string& inner) { writeIntervals(inner, report.assembly); });
+  object.count("beyond_pair_limit", report.beyondPairLimit);
+  object.count("without_exe", report.assembly.withoutImagePath);
+  object.raw("store", terminalJson(jsonLine(storeJson(report.store))));
+  object.array("files", report.store.files, writeFile);
+  object.number("start", Number{int64_t{tally.period().start.time_since_epoch().count()}});
+  object.number("end", Number{int64_t{tally.period().end.time_since_epoch().count()}});
+  object.end();
+  return out;
+}
+
+std::string summaryText(const Tally& tally, const ExtractionReport& report,
+                        const Terminal& terminal) {
+  std::string out = dateText(tally.period().start) + " to " + dateText(tally.period().end) + "\n" +
+                    counted(report.entriesRead, "log event", "log events") + ", " +
+                    counted(tally.traceObjects(), "trace object", "trace objects") + "\n\n" +
+                    verdictTable(tally, terminal);
+  if (tally.traceObjects() != 0)
+    out += "\n" + kindTable(tally, terminal) + "\n" + pairTable(tally, terminal);
+  if (tally.verdicts()[TesselReporterClassificationFailedStringWhitelist] != 0) {
+    out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +
+           missTable(tally, terminal);
+  }
+  return out + lossLines(report, terminal) + storeLines(report, terminal) +
+         fileLines(report.store, terminal);
+}
+
+}  // namespace tessel::ctl

@@ -1,0 +1,41 @@
+#include "trace/DecimalNumber.h"
+
+#include <charconv>
+#include <cmath>
+#include <cstdint>
+#include <limits>
+
+namespace tessel {
+
+namespace {
+
+template <typename T>
+std::optional<T> parseWhole(std::string_view text) {
+  T value{};
+  const char* end = text.data() + text.size();
+  const auto [at, error] = std::from_chars(text.data(), end, value);
+  if (error != std::errc() || at != end) return std::nullopt;
+  return value;
+}
+
+std::optional<double> parseFinite(std::string_view text) {
+  const std::optional<double> value = parseWhole<double>(text);
+  return value && std::isfinite(*value) ? value : std::nullopt;
+}
+
+}  // namespace
+
+std::optional<Number> parseDecimal(std::string_view text) {
+  if (const auto whole = parseWhole<int64_t>(text)) return *whole;
+  if (const auto whole = parseWhole<uint64_t>(text)) return *whole;
+  if (const auto real = parseFinite(text)) return *real;
+  return std::nullopt;
+}
+
+std::optional<float> parseFloat(std::string_view text) {
+  const auto real = parseFinite(text);
+  if (!real || std::fabs(*real) > double{std::numeric_limits<float>::max()}) return std::nullopt;
+  return static_cast<float>(*real);
+}
+
+}  // namespace tessel

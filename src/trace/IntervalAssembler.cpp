@@ -1,0 +1,204 @@
+// Reading one trace point, pairing, and the making of objects.
+
+#include "trace/IntervalAssembler.h"
+
+#include <algorithm>
+
+namespace tessel {
+
+namespace {
+
+FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
+  return tokens[static_cast<size_t>(kind)];
+}
+
+}  // namespace
+
+IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
+                                     OpenIntervalLimits limits)
+    : table_(table), sink_(sink), open_(limits) {
+  table_.setHolder(this);
+}
+
+IntervalAssembler::~IntervalAssembler() { table_.setHolder(nullptr); }
+
+AssemblyCounts IntervalAssembler::counts() const {
+  AssemblyCounts counts = counts_;
+  counts.droppedOpenIntervals = open_.dropped();
+  counts.openIntervals = open_.size();
+  return counts;
+}
+
+void IntervalAssembler::consume(const Entry& entry) {
+  if (!meansToBeATracePoint(entry.tokens)) return;
+  read(entry.tokens);
+  if (const auto reason = fault()) {
+    ++counts_.malformed[static_cast<size_t>(*reason)];
+    return;
+  }
+  ++counts_.tracePoints;
+  if (point_[FieldKind::imagePath] == kNoToken) ++counts_.withoutImagePath;
+  switch (table_.pointKind(point_[FieldKind::pointKind])) {
+    case PointKind::event:
+      return emitEvent();
+    case PointKind::begin:
+      return begin(entry.header);
+    case PointKind::end:
+      return end(entry.header);
+  }
+}
+
+// Whether an entry has one of the fields that a trace point must have, good or not.
+bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens) const {
+  return std::any_of(tokens.begin(), tokens.end(), [this](FieldToken token) {
+    const FieldKind kind = TracePointTable::kind(token);
+    return isRequired(kind) || (kind == FieldKind::malformed && table_.malformedIsRequired(token));
+  });
+}
+
+void IntervalAssembler::read(std::span<const FieldToken> tokens) {
+  point_.tokens.fill(kNoToken);
+  point_.attributes.clear();
+  point_.malformed = kNoToken;
+  for (const FieldToken token : tokens) {
+    const FieldKind kind = TracePointTable::kind(token);
+    if (kind < FieldKind::attribute) [[likely]] {
+      point_.tokens[static_cast<size_t>(kind)] = token;
+    } else if (kind == FieldKind::attribute) {
+      point_.attributes.push_back(token);
+    } else if (kind == FieldKind::malformed) {
+      point_.malformed = token;
+    }
+  }
+}
+
+std::optional<MalformedReason> IntervalAssembler::fault() const {
+  if (point_.malformed != kNoToken) return table_.malformedReason(point_.malformed);
+  if (point_[FieldKind::pointKind] == kNoToken) return MalformedReason::missingKind;
+  if (point_[FieldKind::subsystem] == kNoToken) return MalformedReason::missingSubsystem;
+  if (point_[FieldKind::category] == kNoToken) return MalformedReason::missingCategory;
+  if (point_.attributes.size() > kMaxAttributes) return MalformedReason::tooManyAttributes;
+  return std::nullopt;
+}
+
+void IntervalAssembler::emitEvent() {
+  if (!sink_.admits(table_.text(point_[FieldKind::subsystem]),
+                    table_.text(point_[FieldKind::category]))) {
+    return;
+  }
+  sink_.deliverEvent(
+      std::make_shared<const TesselEvent>(fieldsOf(point_.tokens, 0), processOf(point_.tokens)));
+}
+
+void IntervalAssembler::begin(const EntryHeader& header) {
+  const size_t before = open_.size();
+  const uint64_t droppedBefore = open_.dropped();
+  open_.open(keyOf(header), header.monotonic, point_.tokens, point_.attributes);
+  if (open_.size() == before && open_.dropped() == droppedBefore) ++counts_.replacedBegins;
+}
+
+void IntervalAssembler::end(const EntryHeader& header) {
+  const OpenInterval* begin = open_.find(keyOf(header));
+  if (begin == nullptr) {
+    ++counts_.unmatchedEnds;
+    return;
+  }
+  const auto microseconds = static_cast<int64_t>(header.monotonic - begin->monotonic);
+  const auto seconds = static_cast<float>(static_cast<double>(microseconds) / 1e6);
+  if (sink_.admits(table_.text(begin->key.subsystem), table_.text(begin->key.category))) {
+    deliverMerged(begin->tokens, begin->attributes, seconds);
+  }
+  open_.close(begin);
+}
+
+void IntervalAssembler::deliverMerged(const PointTokens& begin,
+                                      const std::vector<FieldToken>& beginAttributes,
+                                      float measuredSeconds) {
+  PointTokens merged;
+  for (size_t slot = 0; slot < kPointSlots; ++slot) {
+    merged[slot] = point_.tokens[slot] != kNoToken ? point_.tokens[slot] : begin[slot];
+  }
+  TracePointFields fields = fieldsOf(merged, measuredSeconds);
+  fields.telemetryEnabled = table_.flag(tokenOf(begin, FieldKind::telemetry)) ||
+                            table_.flag(point_[FieldKind::telemetry]);
+  IntervalFields interval{processOf(begin), processOf(point_.tokens), {}};
+  appendAttributes(point_.attributes, interval);
+  appendAttributes(beginAttributes, interval);
+  const FieldToken frameRate = tokenOf(merged, FieldKind::frameRate);
+  if (frameRate == kNoToken) {
+    sink_.deliverInterval(
+        std::make_shared<const TesselInterval>(std::move(fields), std::move(interval)));
+  } else {
+    sink_.deliverAnimationInterval(std::make_shared<const TesselAnimationInterval>(
+        std::move(fields), std::move(interval), table_.real(frameRate)));
+  }
+}
+
+IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
+  const bool system = table_.flag(point_[FieldKind::scope]);
+  return {table_.identity(point_[FieldKind::intervalId]),
+          table_.bootToken(header.bootId),
+          point_[FieldKind::subsystem],
+          point_[FieldKind::category],
+          point_[FieldKind::name],
+          system ? IntervalKey::kSystemScope : point_[FieldKind::process]};
+}
+
+TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
+                                             float measuredSeconds) const {
+  const auto text = [&](FieldKind kind) { return table_.text(tokenOf(tokens, kind)); };
+  const auto number = [&](FieldKind kind) { return table_.number(tokenOf(tokens, kind)); };
+  const FieldToken duration = tokenOf(tokens, FieldKind::duration);
+  TracePointFields fields;
+  fields.strings = table_.strings();
+  fields.subsystem = text(FieldKind::subsystem);
+  fields.category = text(FieldKind::category);
+  fields.name = text(FieldKind::name);
+  fields.string1Name = text(FieldKind::string1Name);
+  fields.string1Value = text(FieldKind::string1Value);
+  fields.string2Name = text(FieldKind::string2Name);
+  fields.string2Value = text(FieldKind::string2Value);
+  fields.number1Name = text(FieldKind::number1Name);
+  fields.number1Value = number(FieldKind::number1Value);
+  fields.number2Name = text(FieldKind::number2Name);
+  fields.number2Value = number(FieldKind::number2Value);
+  fields.durationSeconds = duration == kNoToken ? measuredSeconds : table_.real(duration);
+  fields.telemetryEnabled = table_.flag(tokenOf(tokens, FieldKind::telemetry));
+  return fields;
+}
+
+EmittingProcess IntervalAssembler::processOf(const PointTokens& tokens) const {
+  return {table_.text(tokenOf(tokens, FieldKind::imagePath)),
+          table_.text(tokenOf(tokens, FieldKind::processName))};
+}
+
+// Adds the attributes whose key is not there yet.
+void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
+                                         IntervalFields& interval) const {
+  for (const FieldToken token : tokens) {
+    const auto& attribute = table_.attribute(token);
+    const bool known = std::any_of(
+        interval.attributes.begin(), interval.attributes.end(),
+        [&](const auto& other) { return other.first.record() == attribute.first.record(); });
+    if (!known) interval.attributes.push_back(attribute);
+  }
+}
+
+void IntervalAssembler::renewTokens(TracePointTable& table) {
+  open_.renewAll([&](OpenInterval& interval) {
+    if (!table.hasRoomForRenewal()) return false;
+    for (FieldToken& token : interval.tokens) token = table.renewed(token);
+    for (FieldToken& token : interval.attributes) token = table.renewed(token);
+    const auto token = [&](FieldKind kind) { return tokenOf(interval.tokens, kind); };
+    IntervalKey& key = interval.key;
+    key.boot = table.renewed(key.boot);
+    key.subsystem = token(FieldKind::subsystem);
+    key.category = token(FieldKind::category);
+    key.name = token(FieldKind::name);
+    key.id = table.identity(token(FieldKind::intervalId));
+    if (key.process != IntervalKey::kSystemScope) key.process = token(FieldKind::process);
+    return true;
+  });
+}
+
+}  // namespace tessel

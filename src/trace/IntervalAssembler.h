@@ -1,0 +1,90 @@
+// IntervalAssembler: from the tokens of entries to trace objects.
+//
+// Events are delivered as they come, intervals when their end comes. Begin and end match on boot,
+// subsystem, category, name, id and, in process scope, process; a second begin replaces the first,
+// an end without a begin is counted. Every field that the end lacks is taken from the begin, and
+// telemetry is on when either says so. With a frame rate on either end it is an animation interval.
+//
+// Nothing here looks at text: pairing compares tokens, objects borrow interned strings.
+//
+// Threads: one at a time.
+
+#pragma once
+
+#include <array>
+#include <memory>
+
+#include "journal/EntryStream.h"
+#include "objects/TesselObject.h"
+#include "trace/OpenIntervals.h"
+#include "trace/TracePointTable.h"
+
+namespace tessel {
+
+// Attributes that one entry may carry.
+inline constexpr size_t kMaxAttributes = 32;
+
+// Where assembled objects go.
+class TraceObjectSink {
+ public:
+  virtual ~TraceObjectSink() = default;
+  // Whether an object of this subsystem and category is to be made at all.
+  virtual bool admits(StringRef subsystem, StringRef category) = 0;
+  virtual void deliverEvent(std::shared_ptr<const TesselEvent> event) = 0;
+  virtual void deliverInterval(std::shared_ptr<const TesselInterval> interval) = 0;
+  virtual void deliverAnimationInterval(
+      std::shared_ptr<const TesselAnimationInterval> interval) = 0;
+};
+
+struct AssemblyCounts {
+  uint64_t tracePoints = 0;  // well-formed entries: events, begins, ends
+  std::array<uint64_t, kMalformedReasons> malformed{};
+  uint64_t withoutImagePath = 0;      // trace points without _EXE
+  uint64_t unmatchedEnds = 0;         // ends whose begin was not read
+  uint64_t replacedBegins = 0;        // begins that a second one with the same key replaced
+  uint64_t droppedOpenIntervals = 0;  // open intervals beyond the limits
+  uint64_t openIntervals = 0;         // begins that still wait for their end
+};
+
+class IntervalAssembler final : private TokenHolder {
+ public:
+  // REQUIRES: table and sink outlive the assembler. It is the table's token holder.
+  IntervalAssembler(TracePointTable& table, TraceObjectSink& sink, OpenIntervalLimits limits = {});
+  ~IntervalAssembler() override;
+  IntervalAssembler(const IntervalAssembler&) = delete;
+  IntervalAssembler& operator=(const IntervalAssembler&) = delete;
+
+  void consume(const Entry& entry);
+  AssemblyCounts counts() const;
+
+ private:
+  struct Point {
+    PointTokens tokens;
+    std::vector<FieldToken> attributes;
+    FieldToken malformed;
+
+    FieldToken operator[](FieldKind kind) const { return tokens[static_cast<size_t>(kind)]; }
+  };
+
+  void renewTokens(TracePointTable& table) override;
+  bool meansToBeATracePoint(std::span<const FieldToken> tokens) const;
+  void read(std::span<const FieldToken> tokens);
+  std::optional<MalformedReason> fault() const;
+  void emitEvent();
+  void begin(const EntryHeader& header);
+  void end(const EntryHeader& header);
+  void deliverMerged(const PointTokens& begin, const std::vector<FieldToken>& attributes,
+                     float measuredSeconds);
+  IntervalKey keyOf(const EntryHeader& header);
+  TracePointFields fieldsOf(const PointTokens& tokens, float measuredSeconds) const;
+  EmittingProcess processOf(const PointTokens& tokens) const;
+  void appendAttributes(const std::vector<FieldToken>& tokens, IntervalFields& interval) const;
+
+  TracePointTable& table_;
+  TraceObjectSink& sink_;
+  OpenIntervals open_;
+  Point point_{};
+  AssemblyCounts counts_;
+};
+
+}  // namespace tessel

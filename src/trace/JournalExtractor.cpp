@@ -1,0 +1,108 @@
+#include "trace/JournalExtractor.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "journal/TraceStore.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr uint64_t kEntriesPerStep = 4096;
+
+// Dates before 1970 are before every entry.
+uint64_t microsecondsSince1970(Date date) {
+  return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
+}
+
+}  // namespace
+
+JournalExtractor::JournalExtractor(std::optional<std::string> systemStore,
+                                   const ExtractionLimits& limits)
+    : systemStore_(std::move(systemStore)),
+      table_(limits.table),
+      pairs_(limits.pairs),
+      assembler_(table_, *this, limits.openIntervals) {}
+
+void JournalExtractor::setIntervalCompletionProcessingBlock(IntervalCallback callback) {
+  interval_ = std::move(callback);
+}
+
+void JournalExtractor::setAnimationIntervalCompletionProcessingBlock(
+    AnimationIntervalCallback callback) {
+  animationInterval_ = std::move(callback);
+}
+
+void JournalExtractor::setEmitEventProcessingBlock(EventCallback callback) {
+  event_ = std::move(callback);
+}
+
+void JournalExtractor::setBuildAnimationCompositeIntervalTimelines(bool build) {
+  buildCompositeTimelines_ = build;
+}
+
+void JournalExtractor::stopProcessing() { stop_.store(true, std::memory_order_relaxed); }
+
+bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string>& path,
+                                                 Date startDate, Date endDate,
+                                                 std::optional<PlatformError>& errorOut) {
+  if (stop_.load(std::memory_order_relaxed)) {
+    report_.stopped = true;
+    return true;
+  }
+  const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
+  auto opened = TraceStore::open(path ? path : systemStore_, range, table_, stop_);
+  if (auto* error = std::get_if<PlatformError>(&opened)) {
+    errorOut = std::move(*error);
+    return false;
+  }
+  TraceStore& store = *std::get<std::unique_ptr<TraceStore>>(opened);
+  processEntries(store.entries());
+  report_.store = store.report();
+  logReport(report());
+  return true;
+}
+
+void JournalExtractor::processEntries(EntryStream& entries) {
+  while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
+    if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
+    const Entry entry = entries.entry();
+    current_ = &entry.header;
+    assembler_.consume(entry);
+  }
+  report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);
+}
+
+ExtractionReport JournalExtractor::report() const {
+  ExtractionReport report = report_;
+  report.assembly = assembler_.counts();
+  report.pairs = pairs_.pairs();
+  report.beyondPairLimit = pairs_.refusals();
+  return report;
+}
+
+bool JournalExtractor::admits(StringRef subsystem, StringRef category) {
+  return pairs_.admits(subsystem, category);
+}
+
+template <typename Callback, typename Object>
+void JournalExtractor::deliver(const Callback& callback, const Object& object) {
+  ++report_.delivered;
+  if (callback && !callback(object)) refused_ = true;
+}
+
+void JournalExtractor::deliverEvent(std::shared_ptr<const TesselEvent> event) {
+  deliver(event_, event);
+}
+
+void JournalExtractor::deliverInterval(std::shared_ptr<const TesselInterval> interval) {
+  deliver(interval_, interval);
+}
+
+void JournalExtractor::deliverAnimationInterval(
+    std::shared_ptr<const TesselAnimationInterval> interval) {
+  deliver(animationInterval_, interval);
+}
+
+}  // namespace tessel

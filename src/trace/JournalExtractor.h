@@ -1,0 +1,87 @@
+// JournalExtractor: the trace-extraction service over a trace store.
+//
+// Reads the store once, entry by entry on the calling thread, and calls back in between. A callback
+// that answers false ends the processing call as a stop does. An extractor that was stopped stays
+// stopped.
+//
+// Threads: stopProcessing() may come from any thread at any time; everything else belongs to the
+// thread of the run.
+
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "journal/EntryStream.h"
+#include "objects/TesselSupportObjectExtractor.h"
+#include "platform/ServiceStatus.h"
+#include "trace/ExtractionReport.h"
+#include "trace/IntervalAssembler.h"
+#include "trace/PairLimit.h"
+#include "trace/TracePointTable.h"
+
+namespace tessel {
+
+struct ExtractionLimits {
+  TracePointTableLimits table;
+  OpenIntervalLimits openIntervals;
+  PairLimits pairs;
+};
+
+class JournalExtractor final : public TesselSupportObjectExtractor, private TraceObjectSink {
+ public:
+  // `systemStore` is where the system's own trace store is; absent, it is the machine's journal.
+  explicit JournalExtractor(std::optional<std::string> systemStore = std::nullopt,
+                            const ExtractionLimits& limits = {});
+  // Tells `status`, which must outlive the extractor, every few thousand entries that it gets on.
+  void reportProgressTo(ServiceStatus& status) { status_ = &status; }
+
+  void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;
+  void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
+  void setEmitEventProcessingBlock(EventCallback callback) override;
+  // Composite timelines are not built; the option is kept for the interface's sake.
+  void setBuildAnimationCompositeIntervalTimelines(bool build) override;
+  bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
+                                 Date endDate, std::optional<PlatformError>& errorOut) override;
+  void stopProcessing() override;
+  uint64_t processedEventCount() const override { return report_.entriesRead; }
+
+  // Delivers what `entries` holds until it ends or a stop takes effect. May be called again, with
+  // the same stream after it grew or with another: intervals that are open stay open in between.
+  // REQUIRES: the stream was made with tokenizer() and stopFlag().
+  void processEntries(EntryStream& entries);
+  FieldTokenizer& tokenizer() { return table_; }
+  const StopFlag& stopFlag() const { return stop_; }
+
+  // Where the entry stands that the object of the running callback came from; an interval comes
+  // from its end. REQUIRES: a callback is running.
+  const EntryHeader& currentEntry() const { return *current_; }
+  // About what was processed so far; the store's part is there after the processing call.
+  ExtractionReport report() const;
+
+ private:
+  bool admits(StringRef subsystem, StringRef category) override;
+  void deliverEvent(std::shared_ptr<const TesselEvent> event) override;
+  void deliverInterval(std::shared_ptr<const TesselInterval> interval) override;
+  void deliverAnimationInterval(std::shared_ptr<const TesselAnimationInterval> interval) override;
+  template <typename Callback, typename Object>
+  void deliver(const Callback& callback, const Object& object);
+
+  const std::optional<std::string> systemStore_;
+  TracePointTable table_;
+  PairLimit pairs_;
+  IntervalAssembler assembler_;
+  StopFlag stop_ = false;
+  bool refused_ = false;  // a callback answered false
+
+  IntervalCallback interval_;
+  AnimationIntervalCallback animationInterval_;
+  EventCallback event_;
+  bool buildCompositeTimelines_ = false;
+  ServiceStatus* status_ = nullptr;
+
+  const EntryHeader* current_ = nullptr;  // while an entry is looked at
+  ExtractionReport report_;
+};
+
+}  // namespace tessel
