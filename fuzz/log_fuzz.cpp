@@ -7,7 +7,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/LogFormat.h"
+#include "platform/Log.h"
 #include "platform/Payload.h"
 #include "platform/PlainText.h"
 

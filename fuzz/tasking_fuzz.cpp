@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <string_view>
 
-#include "statora/ConfigurationJson.h"
+#include "statora/ConfigurationFiles.h"
 #include "tasking/TaskingGate.h"
 
 namespace {

@@ -19,9 +19,9 @@
 #include "forwarder/Collector.h"
 #include "forwarder/OtlpBody.h"
 #include "forwarder/Policy.h"
-#include "platform/Clock.h"
-#include "platform/Semaphore.h"
-#include "platform/ServiceStatus.h"
+#include "platform/Queues.h"
+#include "platform/Service.h"
+#include "platform/System.h"
 #include "statora/ForwarderState.h"
 
 namespace tessel {

@@ -10,16 +10,13 @@
 #include <random>
 
 #include "forwarder/Batch.h"
-#include "forwarder/CurlCollector.h"
+#include "forwarder/Collector.h"
 #include "forwarder/Forwarder.h"
 #include "forwarder/Settings.h"
 #include "linux/LogSinks.h"
-#include "linux/ProcessSetup.h"
-#include "linux/ServiceManager.h"
-#include "linux/SystemClock.h"
-#include "linux/ThreadSignalSource.h"
-#include "platform/Semaphore.h"
-#include "platform/WorkerQueue.h"
+#include "linux/ServiceRuntime.h"
+#include "linux/SystemFacts.h"
+#include "platform/Queues.h"
 
 namespace tessel {
 namespace {

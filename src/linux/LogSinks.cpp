@@ -8,7 +8,6 @@
 #include <sys/uio.h>
 #include <systemd/sd-journal.h>
 
-#include "linux/MessageIds.h"
 #include "os/Files.h"
 #include "platform/PlainText.h"
 

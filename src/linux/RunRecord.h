@@ -14,7 +14,7 @@
 #include <vector>
 
 #include "linux/ReadingDigest.h"
-#include "platform/Clock.h"
+#include "platform/System.h"
 
 namespace tessel {
 

@@ -1,13 +1,135 @@
-// The life of the process.
+// Process setup, the notification protocol, signals on a thread, the life of the process.
 
 #include "linux/ServiceRuntime.h"
 
+#include <fcntl.h>
+#include <malloc.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cassert>
+#include <csignal>
 #include <cstdlib>
+#include <thread>
 #include <utility>
 
-#include "linux/ThreadSignalSource.h"
+#include "platform/PlainText.h"
 
 namespace tessel {
+
+namespace {
+
+void fillStandardDescriptors() {
+  // open() answers the lowest free number, so each call fills one gap or lands above them.
+  for (;;) {
+    const int fd =
+        ::open("/dev/null", O_RDWR);  // kept open: inherited like any standard descriptor
+    if (fd > STDERR_FILENO) ::close(fd);
+    if (fd < 0 || fd > STDERR_FILENO) return;
+  }
+}
+
+// A run's large blocks are mapped apart and go back when they are freed, where the C library would
+// move its threshold up and keep them; and the few threads share two heaps, so that what one thread
+// frees is used by the next.
+void keepHeapSmall() {
+  constexpr int kLargeBlockBytes = 128 << 10;
+  constexpr int kHeaps = 2;
+  mallopt(M_MMAP_THRESHOLD, kLargeBlockBytes);
+  mallopt(M_ARENA_MAX, kHeaps);
+}
+
+}  // namespace
+
+void blockSignal(int signalNumber) {
+  sigset_t signals;
+  sigemptyset(&signals);
+  sigaddset(&signals, signalNumber);
+  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+}
+
+void prepareProcess() {
+  blockSignal(SIGINT);
+  std::signal(SIGPIPE, SIG_IGN);
+  fillStandardDescriptors();
+  keepHeapSmall();
+}
+
+namespace {
+constexpr int kFeedsPerWatchdogPeriod = 4;
+}
+
+ServiceManager::ServiceManager(Clock& clock, Notify notify, std::chrono::nanoseconds watchdog)
+    : clock_(clock),
+      notify_(std::move(notify)),
+      feedInterval_(watchdog / kFeedsPerWatchdogPeriod) {}
+
+void ServiceManager::ready() { notify_("READY=1"); }
+
+void ServiceManager::stopping() { notify_("STOPPING=1"); }
+
+void ServiceManager::say(std::string_view words) {
+  {
+    const std::lock_guard lock(wordsMutex_);
+    if (words != words_) {
+      words_ = words;
+      notify_("STATUS=" + plainText(words, " "));
+    }
+  }
+  progress();
+}
+
+void ServiceManager::progress() {
+  if (feedInterval_.count() > 0 && takeFeed()) notify_("WATCHDOG=1");
+}
+
+// True for one of the callers, once a feed interval has passed since the last true.
+bool ServiceManager::takeFeed() {
+  const Timebase base = clock_.timebase();
+  const uint64_t now = clock_.continuousTicks();
+  uint64_t due = nextFeed_.load(std::memory_order_relaxed);
+  if (now < due) return false;
+  const uint64_t interval =
+      static_cast<uint64_t>(feedInterval_.count()) * base.denominator / base.numerator;
+  return nextFeed_.compare_exchange_strong(due, now + interval, std::memory_order_relaxed);
+}
+
+std::unique_ptr<ServiceManager> connectServiceManager(Clock& clock) {
+  uint64_t watchdog = 0;
+  if (sd_watchdog_enabled(0, &watchdog) <= 0) watchdog = 0;
+  return std::make_unique<ServiceManager>(
+      clock, [](const std::string& message) { sd_notify(0, message.c_str()); },
+      std::chrono::microseconds{watchdog});
+}
+
+namespace {
+
+void deliverForEver(int signalNumber, const std::shared_ptr<SerialQueue>& queue,
+                    const Closure& handler) {
+  sigset_t signals;
+  sigemptyset(&signals);
+  sigaddset(&signals, signalNumber);
+  for (;;) {
+    int received = 0;
+    if (sigwait(&signals, &received) == 0) queue->async(handler);
+  }
+}
+
+}  // namespace
+
+ThreadSignalSource::ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue)
+    : signalNumber_(signalNumber), queue_(std::move(queue)) {}
+
+void ThreadSignalSource::setHandler(Closure handler) { handler_ = std::move(handler); }
+
+void ThreadSignalSource::resume() {
+  if (!queue_) return;
+  assert(handler_);
+  std::thread([number = signalNumber_, queue = std::exchange(queue_, nullptr),
+               handler = std::exchange(handler_, nullptr)] {
+    deliverForEver(number, queue, handler);
+  }).detach();
+}
 
 // One unit of a counter of the runtime's.
 class ServiceRuntime::Hold final : public KeepAliveTransaction {

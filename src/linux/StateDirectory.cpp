@@ -1,7 +1,8 @@
-// The state directory on disk.
+// The state directory on disk, and files by descriptor.
 
 #include "linux/StateDirectory.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
@@ -10,10 +11,14 @@
 #include <cerrno>
 #include <charconv>
 #include <filesystem>
+#include <memory>
+#include <string>
 #include <system_error>
+#include <tuple>
 
 #include "os/DurableFile.h"
 #include "os/Files.h"
+#include "os/UniqueFd.h"
 #include "platform/PlainText.h"
 
 namespace tessel {
@@ -81,6 +86,96 @@ std::optional<Date> StateDirectory::lastRun() const {
 
 std::optional<std::string> StateDirectory::recordRun(Date begin) const {
   return replaceFileDurably(recordFile(), std::to_string(begin.time_since_epoch().count()) + '\n');
+}
+
+namespace {
+
+constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+// Tells mounts apart, a directory that is mounted from the same file system included.
+using MountKey = std::tuple<uint64_t, uint32_t, uint32_t>;
+
+std::optional<MountKey> mountOf(int directory) {
+  struct statx facts {};
+  if (::statx(directory, "", AT_EMPTY_PATH | AT_NO_AUTOMOUNT, STATX_MNT_ID, &facts) != 0) return {};
+  return MountKey{facts.stx_mnt_id, facts.stx_dev_major, facts.stx_dev_minor};
+}
+
+struct CloseDirectory {
+  void operator()(DIR* directory) const { ::closedir(directory); }
+};
+using Directory = std::unique_ptr<DIR, CloseDirectory>;
+
+// Removes trees on one mount. Keeps the first error and goes on with the rest.
+class Remover {
+ public:
+  explicit Remover(MountKey mount) : mount_(mount) {}
+
+  // Removes what `parent` calls `name`; `path` is its name in errors.
+  bool remove(int parent, const char* name, const std::string& path, int depth) {
+    if (::unlinkat(parent, name, 0) == 0) return true;
+    const int error = errno;
+    if (!isDirectory(parent, name)) return failed(path, errorWords(error));
+    if (!removeContents(parent, name, path, depth)) return false;
+    return ::unlinkat(parent, name, AT_REMOVEDIR) == 0 || failed(path, errorWords(errno));
+  }
+  const std::string& error() const { return error_; }
+
+ private:
+  static bool isDirectory(int parent, const char* name) {
+    struct stat facts {};
+    return ::fstatat(parent, name, &facts, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(facts.st_mode);
+  }
+
+  bool removeContents(int parent, const char* name, const std::string& path, int depth) {
+    if (depth == LocalFiles::kMaxRemovalDepth) return failed(path, "nested too deeply");
+    UniqueFd fd(::openat(parent, name, kOpenDirectory));
+    if (!fd.valid()) return failed(path, errorWords(errno));
+    if (mountOf(fd.get()) != mount_) return failed(path, "something is mounted here");
+    const Directory directory(::fdopendir(fd.get()));
+    if (!directory) return failed(path, errorWords(errno));
+    const int inside = fd.release();
+    bool removedAll = true;
+    while (const dirent* entry = ::readdir(directory.get())) {
+      const std::string_view item = entry->d_name;
+      if (item == "." || item == "..") continue;
+      removedAll =
+          remove(inside, entry->d_name, path + "/" + entry->d_name, depth + 1) && removedAll;
+    }
+    return removedAll;
+  }
+
+  bool failed(const std::string& path, const std::string& why) {
+    if (error_.empty()) error_ = path + ": " + why;
+    return false;
+  }
+
+  const MountKey mount_;
+  std::string error_;
+};
+
+}  // namespace
+
+FileExistence LocalFiles::existence(const std::string& path) {
+  struct stat facts {};
+  if (::lstat(path.c_str(), &facts) != 0) return {};
+  return {true, S_ISDIR(facts.st_mode)};
+}
+
+bool LocalFiles::createFile(const std::string& path) {
+  constexpr int kNewFile = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+  return UniqueFd(::open(path.c_str(), kNewFile, 0666)).valid();
+}
+
+RemovalResult LocalFiles::remove(const std::string& path) {
+  const std::filesystem::path whole(path);
+  const std::string parentPath = whole.has_parent_path() ? whole.parent_path().string() : ".";
+  const UniqueFd parent(::open(parentPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const std::optional<MountKey> mount = parent.valid() ? mountOf(parent.get()) : std::nullopt;
+  if (!mount) return {false, parentPath + ": " + errorWords(errno)};
+  Remover remover(*mount);
+  if (remover.remove(parent.get(), whole.filename().c_str(), path, 0)) return {true, {}};
+  return {false, remover.error()};
 }
 
 }  // namespace tessel

@@ -1,3 +1,18 @@
+// Files that outlive the process: the state directory, and what the run marker asks of a file
+// system.
+
+#pragma once
+
+#include <optional>
+#include <string>
+#include <utility>
+#include <variant>
+
+#include "os/UniqueFd.h"
+#include "platform/System.h"
+
+namespace tessel {
+
 // StateDirectory: the directory for what outlives the process, and the scheduler's files in it.
 //
 //   scheduler-last-run  when the last run began: microseconds since 1970 in decimal and a line
@@ -9,18 +24,6 @@
 // says so.
 //
 // Immutable once opened; any thread may use it.
-
-#pragma once
-
-#include <optional>
-#include <string>
-#include <utility>
-#include <variant>
-
-#include "os/UniqueFd.h"
-#include "platform/Clock.h"
-
-namespace tessel {
 
 // Holds the right to run until it is destroyed or the process ends.
 class RunLock {
@@ -59,6 +62,21 @@ class StateDirectory {
   std::string recordFile() const { return path_ + "/scheduler-last-run"; }
 
   std::string path_;
+};
+
+// LocalFiles: the marker file's few needs of the file system. Stateless; any thread.
+
+class LocalFiles final : public FileManager {
+ public:
+  FileExistence existence(const std::string& path) override;
+  bool createFile(const std::string& path) override;
+  // A directory goes with all that is in it, but what is mounted below it stays, and so do the
+  // directories above that; neither does more than kMaxRemovalDepth directories in one another. The
+  // error names the first item that could not be removed.
+  RemovalResult remove(const std::string& path) override;
+
+  // A directory in this many others is not looked into: each level holds a descriptor.
+  static constexpr int kMaxRemovalDepth = 128;
 };
 
 }  // namespace tessel

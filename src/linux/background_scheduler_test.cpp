@@ -1,6 +1,6 @@
 // Check-in, runs, deferrals, and one run at a time.
 
-#include "linux/BackgroundScheduler.h"
+#include "linux/Scheduler.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -10,7 +10,6 @@
 #include <stdexcept>
 #include <thread>
 
-#include "linux/RunSchedule.h"
 #include "os/testing/TemporaryDirectory.h"
 #include "platform/testing/Fakes.h"
 

@@ -1,6 +1,6 @@
 // What defers a run, on machines of every kind.
 
-#include "linux/DeferralConditions.h"
+#include "linux/Scheduler.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 // The marker file's needs of a file system, on a real one.
 
-#include "linux/LocalFiles.h"
+#include "linux/StateDirectory.h"
 
 #include <fcntl.h>
 #include <gmock/gmock.h>

@@ -8,10 +8,8 @@
 #include <csignal>
 #include <cstdlib>
 
-#include "linux/ProcessSetup.h"
-#include "linux/ServiceManager.h"
 #include "linux/ServiceRuntime.h"
-#include "platform/WorkerQueue.h"
+#include "platform/Queues.h"
 #include "platform/testing/Fakes.h"
 
 namespace tessel {

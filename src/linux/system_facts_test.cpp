@@ -2,9 +2,7 @@
 
 #include <gtest/gtest.h>
 
-#include "linux/IcuDates.h"
-#include "linux/MountTable.h"
-#include "linux/OsReleaseBuildVariant.h"
+#include "linux/SystemFacts.h"
 #include "os/testing/TemporaryDirectory.h"
 
 namespace tessel {

@@ -19,7 +19,7 @@
 #include <string>
 
 #include "objects/TesselObject.h"
-#include "platform/Clock.h"
+#include "platform/System.h"
 
 namespace tessel {
 

@@ -11,7 +11,7 @@
 
 #include "platform/Number.h"
 #include "platform/Payload.h"
-#include "platform/SerialQueue.h"
+#include "platform/Queues.h"
 
 namespace tessel {
 

@@ -10,12 +10,137 @@
 #pragma once
 
 #include <atomic>
+#include <concepts>
+#include <cstdint>
+#include <initializer_list>
 #include <string>
 #include <string_view>
+#include <type_traits>
+#include <variant>
 
-#include "platform/LogFormat.h"
+#include "platform/SharedString.h"
 
 namespace tessel {
+
+// LogFormat: a message text that is checked against its arguments when it is compiled.
+
+namespace detail {
+
+enum class LogArgumentKind { text, unsigned32, unsigned64, signed64, floating, none };
+
+template <typename T>
+concept Described = requires(const T& thing) {
+  { thing.description() } -> std::convertible_to<std::string>;
+};
+
+template <typename T>
+consteval LogArgumentKind kindOf() {
+  using Plain = std::remove_cvref_t<T>;
+  constexpr bool isText = Described<Plain> || std::is_same_v<Plain, StringRef> ||
+                          std::is_same_v<Plain, SharedString> ||
+                          std::is_convertible_v<const Plain&, std::string_view>;
+  if constexpr (isText) {
+    return LogArgumentKind::text;
+  } else if constexpr (std::is_floating_point_v<Plain>) {
+    return LogArgumentKind::floating;
+  } else if constexpr (!std::is_integral_v<Plain> || std::is_same_v<Plain, bool>) {
+    return LogArgumentKind::none;
+  } else if constexpr (sizeof(Plain) == 8) {
+    return std::is_unsigned<Plain>::value ? LogArgumentKind::unsigned64 : LogArgumentKind::signed64;
+  } else {
+    return std::is_same_v<Plain, uint32_t> ? LogArgumentKind::unsigned32 : LogArgumentKind::none;
+  }
+}
+
+struct LogConversion {
+  LogArgumentKind kind;
+  size_t length;  // of the conversion, the percent sign included; 0 where it is none that is known
+};
+
+constexpr LogConversion conversionAt(std::string_view rest) {
+  constexpr struct {
+    std::string_view text;
+    LogArgumentKind kind;
+  } kConversions[] = {
+      {"%@", LogArgumentKind::text},         {"%s", LogArgumentKind::text},
+      {"%llu", LogArgumentKind::unsigned64}, {"%lu", LogArgumentKind::unsigned64},
+      {"%ld", LogArgumentKind::signed64},    {"%u", LogArgumentKind::unsigned32},
+      {"%f", LogArgumentKind::floating},     {"%.2f", LogArgumentKind::floating},
+  };
+  for (const auto& known : kConversions) {
+    if (rest.starts_with(known.text)) return {known.kind, known.text.size()};
+  }
+  return {LogArgumentKind::none, 0};
+}
+
+}  // namespace detail
+
+// A message text whose conversions fit `Args`, in number and kind; anything else does not compile.
+template <typename... Args>
+class LogFormat {
+ public:
+  template <size_t N>
+  consteval LogFormat(const char (&text)[N]) : text_(text, N - 1) {
+    constexpr detail::LogArgumentKind kinds[] = {detail::kindOf<Args>()...,
+                                                 detail::LogArgumentKind::none};
+    size_t used = 0;
+    for (size_t at = text_.find('%'); at != std::string_view::npos; at = text_.find('%', at)) {
+      const detail::LogConversion conversion = detail::conversionAt(text_.substr(at));
+      if (conversion.length == 0) throw "unknown conversion in a log message";
+      if (used >= sizeof...(Args)) throw "a log message has more conversions than arguments";
+      if (kinds[used] != conversion.kind) throw "a log argument does not fit its conversion";
+      ++used;
+      at += conversion.length;
+    }
+    if (used != sizeof...(Args)) throw "a log message has fewer conversions than arguments";
+  }
+  constexpr std::string_view text() const { return text_; }
+
+ private:
+  std::string_view text_;
+};
+
+// One argument, ready to be formatted. An absent string reads "(null)".
+class LogArgument {
+ public:
+  template <typename T>
+  LogArgument(const T& value) {
+    if constexpr (std::is_floating_point_v<T>) {
+      value_ = static_cast<double>(value);
+    } else if constexpr (std::is_integral_v<T> && std::is_signed_v<T>) {
+      value_ = static_cast<int64_t>(value);
+    } else if constexpr (std::is_integral_v<T>) {
+      value_ = static_cast<uint64_t>(value);
+    } else if constexpr (detail::Described<T>) {
+      value_ = std::string(value.description());
+    } else if constexpr (std::is_same_v<T, StringRef> || std::is_same_v<T, SharedString>) {
+      value_ = value.textOr("(null)");
+    } else {
+      value_ = std::string_view(value);
+    }
+  }
+  void appendTo(std::string& out, std::string_view conversion) const;
+
+ private:
+  std::variant<std::string_view, std::string, uint64_t, int64_t, double> value_;
+};
+
+// REQUIRES: `text` was checked by LogFormat against the same arguments.
+std::string formatLogArguments(std::string_view text, std::initializer_list<LogArgument> arguments);
+
+template <typename... Args>
+std::string formatLog(std::string_view text, Args&&... arguments) {
+  return formatLogArguments(text, {std::forward<Args>(arguments)...});
+}
+
+// The system log: levels, the sink behind it, and the one ambient handle, tesselReporterLog().
+//
+// Message texts are given as they stand, with %@ for a string or a thing with a description(), and
+// %llu %lu (unsigned 64-bit), %ld (signed 64-bit), %u (unsigned 32-bit), %f %.2f (floating point),
+// %s (text). They are checked against the arguments when the call is compiled and formatted only
+// where the level is enabled.
+//
+// Threads: any. The sink is installed once, before the first thread starts, and never removed.
 
 enum class LogLevel { error = 0, debug = 1 };
 

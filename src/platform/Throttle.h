@@ -12,7 +12,7 @@
 #include <cstdint>
 #include <mutex>
 
-#include "platform/Clock.h"
+#include "platform/System.h"
 
 namespace tessel {
 

@@ -14,7 +14,7 @@
 #include "objects/ProcessIdentity.h"
 #include "objects/TesselObject.h"
 #include "platform/Analytics.h"
-#include "platform/SerialQueue.h"
+#include "platform/Queues.h"
 #include "platform/Throttle.h"
 
 namespace tessel {

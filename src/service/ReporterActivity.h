@@ -4,8 +4,7 @@
 
 #include <memory>
 
-#include "platform/Activity.h"
-#include "platform/Runtime.h"
+#include "platform/Service.h"
 #include "service/ReportingRun.h"
 
 namespace tessel {

@@ -14,10 +14,8 @@
 
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
-#include "platform/Activity.h"
-#include "platform/Clock.h"
-#include "platform/SerialQueue.h"
-#include "platform/ServiceStatus.h"
+#include "platform/Queues.h"
+#include "platform/Service.h"
 #include "platform/System.h"
 #include "service/CookieFile.h"
 #include "service/ObjectReporter.h"

@@ -8,7 +8,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "statora/SpoolDatabase.h"
+#include "statora/Spool.h"
 
 namespace tessel {
 

@@ -21,7 +21,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Clock.h"
+#include "platform/System.h"
 #include "statora/Sqlite.h"
 
 namespace tessel {

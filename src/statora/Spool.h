@@ -1,3 +1,33 @@
+// The spool: its database, and the event sender that fills it.
+
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "platform/Analytics.h"
+#include "platform/System.h"
+#include "statora/Sqlite.h"
+
+namespace tessel {
+
+// The spool's database: its name, its schema, and the one place where it is opened and upgraded.
+//
+//   events  one row per event, in send order
+//   meta    facts about this spool; `spool_id` is 32 hexadecimal digits drawn when it was made
+//
+// The forwarder keeps tables of its own in the same file; see ForwarderState.h among the tools.
+
+inline constexpr char kSpoolFileName[] = "statora.db";
+inline constexpr int kSpoolSchemaVersion = 1;
+
+// Opens the spool at `path`, makes it where there is none, and brings it up to this schema version.
+// Fails with SQLITE_SCHEMA where it was made by a newer version; nothing in it is changed then.
+SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
+                               int busyTimeoutMilliseconds);
+
 // Spool: the analytics service's event sender, a durable queue in an SQLite database.
 //
 // Every send commits one row and flushes the write-ahead log (synchronous=FULL), so that a row is
@@ -15,19 +45,6 @@
 // begun. What was stored is never rewritten.
 //
 // Threads: one at a time, the reporting queue's.
-
-#pragma once
-
-#include <array>
-#include <cstdint>
-#include <string>
-#include <vector>
-
-#include "platform/Analytics.h"
-#include "platform/Clock.h"
-#include "statora/Sqlite.h"
-
-namespace tessel {
 
 enum class SpoolFailure {
   limit,     // the spool holds as much as it may

@@ -2,7 +2,7 @@
 
 #include <gtest/gtest.h>
 
-#include "statora/ConfigurationChanges.h"
+#include "statora/ConfigurationFiles.h"
 
 namespace tessel {
 namespace {

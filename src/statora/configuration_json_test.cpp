@@ -2,7 +2,7 @@
 
 #include <gtest/gtest.h>
 
-#include "statora/ConfigurationJson.h"
+#include "statora/ConfigurationFiles.h"
 
 namespace tessel {
 namespace {

@@ -9,9 +9,8 @@
 #include <thread>
 
 #include "os/testing/TemporaryDirectory.h"
-#include "platform/Semaphore.h"
-#include "platform/WorkerQueue.h"
-#include "statora/FileConfigurationService.h"
+#include "platform/Queues.h"
+#include "statora/ConfigurationFiles.h"
 
 namespace tessel {
 namespace {

@@ -11,7 +11,6 @@
 #include "os/testing/TemporaryDirectory.h"
 #include "platform/testing/Fakes.h"
 #include "statora/Spool.h"
-#include "statora/SpoolDatabase.h"
 
 namespace tessel {
 namespace {

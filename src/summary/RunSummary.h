@@ -14,8 +14,7 @@
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Analytics.h"
-#include "platform/Clock.h"
-#include "platform/ServiceStatus.h"
+#include "platform/Service.h"
 #include "platform/System.h"
 #include "platform/Throttle.h"
 

@@ -5,7 +5,7 @@
 #include <atomic>
 
 #include "platform/Log.h"
-#include "platform/Semaphore.h"
+#include "platform/Queues.h"
 #include "tasking/TesselReporterConfigObserverDelegate.h"
 
 namespace tessel {

@@ -14,8 +14,7 @@
 #include <string_view>
 
 #include "platform/Analytics.h"
-#include "platform/Clock.h"
-#include "platform/SerialQueue.h"
+#include "platform/Queues.h"
 #include "platform/System.h"
 
 namespace tessel {

@@ -10,13 +10,10 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Activity.h"
 #include "platform/Analytics.h"
-#include "platform/Clock.h"
 #include "platform/Log.h"
-#include "platform/Runtime.h"
-#include "platform/SerialQueue.h"
-#include "platform/ServiceStatus.h"
+#include "platform/Queues.h"
+#include "platform/Service.h"
 #include "platform/System.h"
 
 namespace tessel::testing {

@@ -8,7 +8,7 @@
 #include <memory>
 #include <tuple>
 
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
 #include "tesselctl/showing/JsonLine.h"

@@ -10,7 +10,7 @@
 #include <nlohmann/json.hpp>
 #include <thread>
 
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/reading/SpoolReader.h"

@@ -10,8 +10,7 @@
 
 #include "journal/EntryCursor.h"
 #include "linux/AppBundles.h"
-#include "linux/MountTable.h"
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 #include "service/BootVolume.h"
 #include "service/ObjectReporter.h"
 #include "tesselctl/commands/ReadingOptions.h"

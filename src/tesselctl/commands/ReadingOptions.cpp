@@ -4,7 +4,7 @@
 
 #include <cerrno>
 
-#include "linux/OsReleaseBuildVariant.h"
+#include "linux/SystemFacts.h"
 #include "os/Files.h"
 #include "tasking/TaskingGate.h"
 #include "tesselctl/showing/ShownText.h"

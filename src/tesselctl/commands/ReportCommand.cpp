@@ -7,7 +7,7 @@
 #include <memory>
 
 #include "linux/RunRecord.h"
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 #include "os/DurableFile.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/showing/HtmlReport.h"

@@ -7,7 +7,7 @@
 
 #include "os/DurableFile.h"
 #include "os/Files.h"
-#include "statora/FileConfigurationService.h"
+#include "statora/ConfigurationFiles.h"
 #include "tasking/TaskingGate.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/judging/Tasking.h"

@@ -6,9 +6,9 @@
 #include <memory>
 
 #include "journal/TraceStore.h"
-#include "linux/DeferralConditions.h"
+#include "linux/Scheduler.h"
 #include "linux/StateDirectory.h"
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 #include "os/Files.h"
 #include "service/CookieFile.h"
 #include "tesselctl/commands/Environment.h"

@@ -4,10 +4,9 @@
 
 #include <unistd.h>
 
-#include "linux/OsReleaseBuildVariant.h"
+#include "linux/SystemFacts.h"
 #include "os/Files.h"
-#include "statora/ConfigurationJson.h"
-#include "statora/FileConfigurationService.h"
+#include "statora/ConfigurationFiles.h"
 #include "tasking/TaskingGate.h"
 
 namespace tessel::ctl {

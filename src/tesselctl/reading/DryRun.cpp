@@ -8,7 +8,7 @@
 #include <utility>
 
 #include "filter/DefaultDownsampling.h"
-#include "linux/SystemClock.h"
+#include "linux/SystemFacts.h"
 
 namespace tessel::ctl {
 

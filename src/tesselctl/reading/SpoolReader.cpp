@@ -10,7 +10,7 @@
 
 #include "os/Files.h"
 #include "os/UniqueFd.h"
-#include "statora/SpoolDatabase.h"
+#include "statora/Spool.h"
 
 namespace tessel::ctl {
 

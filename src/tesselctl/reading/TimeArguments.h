@@ -16,7 +16,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Clock.h"
+#include "platform/System.h"
 
 namespace tessel::ctl {
 

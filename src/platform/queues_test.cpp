@@ -6,8 +6,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Semaphore.h"
-#include "platform/WorkerQueue.h"
+#include "platform/Queues.h"
 
 namespace tessel {
 namespace {

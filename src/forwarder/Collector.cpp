@@ -1,6 +1,6 @@
 // One request with libcurl.
 
-#include "forwarder/CurlCollector.h"
+#include "forwarder/Collector.h"
 
 #include <curl/curl.h>
 #include <zlib.h>

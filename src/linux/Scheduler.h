@@ -1,3 +1,63 @@
+// The background-activity scheduler: when a run is due, when it is deferred, and its delivery.
+
+#pragma once
+
+#include <algorithm>
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "linux/LaunchConfiguration.h"
+#include "linux/ServiceRuntime.h"
+#include "linux/StateDirectory.h"
+#include "platform/Service.h"
+#include "platform/System.h"
+
+namespace tessel {
+
+// DeferralConditions: whether now is a bad time for a run.
+//
+// Each question is answered from files at the moment it is asked. A file that is missing, cannot be
+// read or makes no sense never defers. Immutable; any thread may ask.
+
+class DeferralConditions {
+ public:
+  // `deferFile` defers by being there. The other two are the kernel's, elsewhere in tests.
+  DeferralConditions(DeferSources sources, std::string deferFile,
+                     std::string powerSupplyDirectory = "/sys/class/power_supply",
+                     std::string pressureFile = "/proc/pressure/cpu");
+
+  // Why a run should wait, in words; nothing where it need not.
+  std::optional<std::string> reason() const;
+
+ private:
+  bool deferFileExists() const;
+  bool batteryIsLow() const;
+  bool cpuIsUnderPressure() const;
+
+  const DeferSources sources_;
+  const std::string deferFile_;
+  const std::string powerSupplyDirectory_;
+  const std::string pressureFile_;
+};
+
+// When the next run is due, as plain arithmetic.
+
+// How long to wait for the run that comes `interval` after the one that began at `lastRun`; zero
+// where it is due. `waited` is how long this wait has lasted, by a clock that nobody sets: however
+// the wall clock is set meanwhile, or stands before the last run, no wait exceeds the interval.
+inline std::chrono::nanoseconds waitForRun(std::optional<Date> lastRun, Date now,
+                                           std::chrono::seconds interval,
+                                           std::chrono::nanoseconds waited) {
+  using std::chrono::nanoseconds;
+  const auto sinceLastRun = lastRun ? now - *lastRun : Date::duration::max();
+  if (sinceLastRun >= interval) return nanoseconds{0};
+  // A run in the future tells nothing: the whole interval is waited for.
+  const nanoseconds byWallClock = interval - std::max(sinceLastRun, Date::duration::zero());
+  return std::clamp(interval - waited, nanoseconds{0}, byWallClock);
+}
+
 // BackgroundScheduler: delivers check-in and runs to the one activity of the process.
 //
 // The check-in comes first. Without an interval one run follows at once, and when it is over
@@ -12,22 +72,6 @@
 // The handler is called on one thread, made by registerActivity(), which lives as long as there is
 // something pending. Everything given to the constructor must outlive the scheduler, and the
 // scheduler its thread: all live as long as the process.
-
-#pragma once
-
-#include <chrono>
-#include <memory>
-#include <optional>
-#include <string>
-
-#include "linux/DeferralConditions.h"
-#include "linux/ServiceRuntime.h"
-#include "linux/StateDirectory.h"
-#include "platform/Activity.h"
-#include "platform/Clock.h"
-#include "platform/ServiceStatus.h"
-
-namespace tessel {
 
 struct ScheduleCriteria {
   std::optional<std::chrono::seconds> interval;

@@ -1,6 +1,6 @@
 // Queues and timers on threads of their own.
 
-#include "platform/WorkerQueue.h"
+#include "platform/Queues.h"
 
 #include <algorithm>
 #include <condition_variable>
@@ -11,8 +11,6 @@
 #include <thread>
 #include <utility>
 #include <vector>
-
-#include "platform/Semaphore.h"
 
 namespace tessel {
 

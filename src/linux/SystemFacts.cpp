@@ -1,0 +1,161 @@
+// Clocks, os-release, mountinfo and ICU.
+
+#include "linux/SystemFacts.h"
+
+#include <unicode/datefmt.h>
+#include <unicode/locid.h>
+#include <unicode/timezone.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <ctime>
+#include <fstream>
+#include <memory>
+#include <sstream>
+#include <thread>
+#include <utility>
+
+#include "os/Files.h"
+
+namespace tessel {
+
+uint64_t SystemClock::continuousTicks() {
+  timespec time{};
+  clock_gettime(CLOCK_BOOTTIME, &time);
+  return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000 + static_cast<uint64_t>(time.tv_nsec);
+}
+
+Date SystemClock::now() {
+  return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
+}
+
+void SystemClock::sleepMicroseconds(uint32_t microseconds) {
+  std::this_thread::sleep_for(std::chrono::microseconds{microseconds});
+}
+
+bool SystemClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
+  return semaphore.waitFor(timeout);
+}
+
+namespace {
+
+constexpr size_t kMaxOsReleaseSize = size_t{64} << 10;
+
+std::string_view withoutQuotes(std::string_view value) {
+  const bool quoted =
+      value.size() >= 2 && (value[0] == '"' || value[0] == '\'') && value.back() == value[0];
+  return quoted ? value.substr(1, value.size() - 2) : value;
+}
+
+// The value of the last assignment to VARIANT_ID, as a shell would have it; empty without one.
+std::string_view variantId(std::string_view text) {
+  constexpr std::string_view kAssignment = "VARIANT_ID=";
+  std::string_view value;
+  while (!text.empty()) {
+    std::string_view line = text.substr(0, text.find('\n'));
+    text.remove_prefix(std::min(line.size() + 1, text.size()));
+    const size_t end = line.find_last_not_of(" \t\r");
+    line = line.substr(0, end == std::string_view::npos ? 0 : end + 1);
+    if (line.starts_with(kAssignment)) value = withoutQuotes(line.substr(kAssignment.size()));
+  }
+  return value;
+}
+
+}  // namespace
+
+OsReleaseBuildVariant::OsReleaseBuildVariant(const std::string& path)
+    : internal_(variantId(readSmallFile(path, kMaxOsReleaseSize).value_or("")) == "internal") {}
+
+bool OsReleaseBuildVariant::hasInternalDiagnostics(std::string_view /*subsystem*/) {
+  return internal_;
+}
+
+namespace {
+
+bool isOctal(char digit) { return digit >= '0' && digit <= '7'; }
+
+// The kernel writes blanks and backslashes in a field as \ooo.
+std::string unescaped(std::string_view field) {
+  std::string out;
+  for (size_t i = 0; i < field.size(); ++i) {
+    if (field[i] == '\\' && i + 3 < field.size() && isOctal(field[i + 1]) &&
+        isOctal(field[i + 2]) && isOctal(field[i + 3])) {
+      out += static_cast<char>((field[i + 1] - '0') * 64 + (field[i + 2] - '0') * 8 +
+                               (field[i + 3] - '0'));
+      i += 3;
+    } else {
+      out += field[i];
+    }
+  }
+  return out;
+}
+
+// The type of the file system in one line, where that is mounted at "/". A line reads
+//   id parent device root MOUNT-POINT options [optional...] - TYPE source options
+std::optional<std::string> typeAtRoot(const std::string& line) {
+  std::istringstream fields(line);
+  std::string field;
+  for (int i = 0; i < 5; ++i) fields >> field;
+  if (!fields || unescaped(field) != "/") return {};
+  while (fields >> field && field != "-") {
+  }
+  if (!(fields >> field)) return {};
+  return unescaped(field);
+}
+
+}  // namespace
+
+std::optional<std::string> MountTable::rootFilesystemTypeName() {
+  std::ifstream table(path_);
+  std::optional<std::string> type;
+  for (std::string line; std::getline(table, line);) {
+    if (auto found = typeAtRoot(line)) type = std::move(found);
+  }
+  return type;
+}
+
+namespace {
+
+std::string localeForDates() {
+  for (const char* variable : {"LC_ALL", "LC_TIME", "LANG"}) {
+    const char* value = std::getenv(variable);
+    if (value && *value) return value;
+  }
+  return "C";
+}
+
+std::unique_ptr<icu::TimeZone> makeTimeZone(const std::optional<std::string>& name) {
+  if (!name) return std::unique_ptr<icu::TimeZone>(icu::TimeZone::detectHostTimeZone());
+  return std::unique_ptr<icu::TimeZone>(
+      icu::TimeZone::createTimeZone(icu::UnicodeString::fromUTF8(*name)));
+}
+
+// ICU must not be given a locale whose name it cannot read; that one counts as none.
+icu::Locale makeLocale(const std::string& name) {
+  const icu::Locale locale = icu::Locale::createCanonical(name.c_str());
+  return locale.isBogus() ? icu::Locale::createCanonical("C") : locale;
+}
+
+}  // namespace
+
+IcuDates::IcuDates() : IcuDates(localeForDates(), {}) {}
+
+IcuDates::IcuDates(std::string locale, std::optional<std::string> timeZone)
+    : locale_(std::move(locale)), timeZone_(std::move(timeZone)) {}
+
+std::string IcuDates::format(Date date) {
+  const auto milliseconds =
+      std::chrono::floor<std::chrono::milliseconds>(date).time_since_epoch().count();
+  const std::unique_ptr<icu::DateFormat> formatter(icu::DateFormat::createDateTimeInstance(
+      icu::DateFormat::kShort, icu::DateFormat::kMedium, makeLocale(locale_)));
+  // ICU without its data can make no format; the log then shows the plain number.
+  if (!formatter) return std::to_string(milliseconds / 1000);
+  if (auto zone = makeTimeZone(timeZone_)) formatter->adoptTimeZone(zone.release());
+  icu::UnicodeString text;
+  formatter->format(static_cast<UDate>(milliseconds), text);
+  std::string utf8;
+  text.toUTF8String(utf8);
+  return utf8;
+}
+
+}  // namespace tessel

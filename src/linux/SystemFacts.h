@@ -1,0 +1,73 @@
+// What this machine says of itself: its clocks, its build variant, its root volume, its dates.
+
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "platform/System.h"
+
+namespace tessel {
+
+// SystemClock: the machine's clocks. Stateless; any thread.
+
+class SystemClock final : public Clock {
+ public:
+  // Nanoseconds since boot, time asleep included.
+  uint64_t continuousTicks() override;
+  Timebase timebase() override { return {1, 1}; }
+  Date now() override;
+  void sleepMicroseconds(uint32_t microseconds) override;
+  bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
+};
+
+// OsReleaseBuildVariant: the build variant by the operating system's own description of itself.
+//
+// The file is read once, by the constructor; questions are answered from memory. Immutable; any
+// thread may ask.
+
+class OsReleaseBuildVariant final : public BuildVariant {
+ public:
+  // `path` names a file in the os-release format. Internal where its VARIANT_ID is "internal"; not
+  // where the file cannot be read or does not say.
+  explicit OsReleaseBuildVariant(const std::string& path);
+
+  // The same for every subsystem.
+  bool hasInternalDiagnostics(std::string_view subsystem) override;
+
+ private:
+  const bool internal_;
+};
+
+// MountTable: facts of the mount table. Read anew for every question; any thread.
+
+class MountTable final : public Volumes {
+ public:
+  // `path` names a file in the kernel's mountinfo format.
+  explicit MountTable(std::string path = "/proc/self/mountinfo") : path_(std::move(path)) {}
+
+  // Of several mounts at "/" the topmost counts: the last in the table.
+  std::optional<std::string> rootFilesystemTypeName() override;
+
+ private:
+  const std::string path_;
+};
+
+// IcuDates: dates as people of this machine's locale and time zone write them. Any thread.
+
+class IcuDates final : public DateFormatter {
+ public:
+  // The locale of the environment for dates ($LC_ALL, $LC_TIME, $LANG) and the machine's time zone
+  // at the moment of formatting.
+  IcuDates();
+  // A locale ("de_DE.UTF-8") and a time zone ("Europe/Berlin") of the caller's choice.
+  IcuDates(std::string locale, std::optional<std::string> timeZone);
+
+  std::string format(Date date) override;
+
+ private:
+  const std::string locale_;
+  const std::optional<std::string> timeZone_;
+};
+
+}  // namespace tessel
