@@ -36,14 +36,11 @@ std::shared_ptr<const TesselEvent> makeEvent(const std::shared_ptr<StringPool>& 
                                              const std::string& subsystem,
                                              const std::string& category, bool labelled) {
   TracePointFields fields;
-  fields.strings = pool;
+  fields.pool = pool;
   fields.subsystem = pool->intern(subsystem);
   fields.category = pool->intern(category);
   fields.name = pool->intern("Open");
-  if (labelled) {
-    fields.string1Name = pool->intern("period");
-    fields.string1Value = pool->intern("week");
-  }
+  if (labelled) fields.strings[0] = {pool->intern("period"), pool->intern("week")};
   fields.durationSeconds = 0.25F;
   fields.telemetryEnabled = true;
   return std::make_shared<TesselEvent>(std::move(fields), EmittingProcess{});

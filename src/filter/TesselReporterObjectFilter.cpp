@@ -18,22 +18,19 @@ const TesselObject* asTesselObject(const TesselSupportObject& object) {
   return object.isKindOf(TesselClass::object) ? static_cast<const TesselObject*>(&object) : nullptr;
 }
 
-FilterDecision& failSlot(FilterDecision& decision, uint8_t slot, StringRef label, StringRef value) {
-  decision.stringSlot = slot;
-  decision.stringLabel = label;
-  decision.stringValue = value;
-  return decision;
+// Counts slots from 0; the decision names them from 1, as their accessors do.
+void failSlot(const TesselObject& object, size_t slot, FilterDecision& decision) {
+  const LabelledString& string = object.labelledStrings()[slot];
+  decision.stringSlot = static_cast<uint8_t>(slot + 1);
+  decision.stringLabel = string.label;
+  decision.stringValue = string.value;
 }
 
 // Says which slot of a performance-logging operation is at fault.
 void failSpecialRule(const TesselObject& object, FilterDecision& decision) {
   decision.specialRule = true;
-  const StringRef component = object.string1Value();
-  if (component.present() && perfLoggingComponentSet().contains(component)) {
-    failSlot(decision, 2, object.string2Name(), object.string2Value());
-  } else {
-    failSlot(decision, 1, object.string1Name(), component);
-  }
+  const bool componentIsKnown = perfLoggingComponentSet().contains(object.string1Value());
+  failSlot(object, componentIsKnown ? 1 : 0, decision);
 }
 
 }  // namespace
@@ -95,16 +92,14 @@ bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& ob
     return false;
   }
   if (!shouldUseStringWhitelist(variant_) || special) return true;
-  return slotPasses(1, object.string1Name(), object.string1Value(), decision) &&
-         slotPasses(2, object.string2Name(), object.string2Value(), decision);
-}
-
-// A slot without a label is not tested, whatever its value.
-bool TesselReporterObjectFilter::slotPasses(uint8_t slot, StringRef label, StringRef value,
-                                            FilterDecision& decision) const {
-  if (!label.present() || stringIsWhitelisted(value, platform_)) return true;
-  failSlot(decision, slot, label, value);
-  return false;
+  for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
+    // A value without a label never leaves the machine, so it need not be a known one.
+    const LabelledString& string = object.labelledStrings()[slot];
+    if (!string.label.present() || stringIsWhitelisted(string.value, platform_)) continue;
+    failSlot(object, slot, decision);
+    return false;
+  }
+  return true;
 }
 
 bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& object,

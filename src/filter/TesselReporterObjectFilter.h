@@ -119,7 +119,6 @@ class TesselReporterObjectFilter {
   TesselReporterObjectFilter(TesselReporterPlatform platform, BuildVariant& variant);
   FilterDecision decide(const TesselSupportObject& object) const;
   bool objectPassesStringFilter(const TesselObject& object, FilterDecision& decision) const;
-  bool slotPasses(uint8_t slot, StringRef label, StringRef value, FilterDecision& decision) const;
   bool objectPassesDownsampling(const TesselObject& object, FilterDecision& decision) const;
   // The aggregation of one classification; null for a code outside the enumeration.
   Aggregation* aggregationFor(TesselReporterClassification classification);

@@ -27,8 +27,7 @@ TEST(FilterCostTest, DecidingAboutKnownPairsAllocatesNothing) {
     if (i % 7 == 0) point.subsystem = "com.vantor.TextInput";
     point.telemetryEnabled = i % 5 != 0;
     point.durationSeconds = i % 11 == 0 ? -1.0F : 1.0F;
-    point.string1Name = "period";
-    point.string1Value = i % 3 == 0 ? "week" : "weekly";
+    point.strings[0] = {"period", i % 3 == 0 ? "week" : "weekly"};
     objects.push_back(testing::makeEvent(point));
   }
   const auto feed = [&] {

@@ -38,8 +38,7 @@ std::shared_ptr<const TesselObject> faultyObject(const std::set<Fault>& faults) 
   TestPoint point;
   if (faults.contains(kTelemetry)) point.telemetryEnabled = false;
   if (faults.contains(kDuration)) point.durationSeconds = -0.001F;
-  point.string1Name = "period";
-  point.string1Value = faults.contains(kString) ? "weekly" : "week";
+  point.strings[0] = {"period", faults.contains(kString) ? "weekly" : "week"};
   if (faults.contains(kDownsampling)) {
     point.subsystem = "com.vantor.quellan.knowledge";
     point.category = "tessel";
@@ -120,9 +119,7 @@ TEST_F(ObjectFilterTest, DownsamplingIsAskedOnlyAboutWhatPassedEverythingElse) {
 
 TEST_F(ObjectFilterTest, ADecisionNamesWhatDecided) {
   TestPoint point;
-  point.string1Name = "period";
-  point.string2Name = "size";
-  point.string2Value = "huge";
+  point.strings = {{{"period", {}}, {"size", "huge"}}};
   for (const int slot : {1, 2}) {
     const auto object = makeEvent(point);
     const FilterDecision decision = filter->inspectTesselObject(*object);
@@ -130,7 +127,7 @@ TEST_F(ObjectFilterTest, ADecisionNamesWhatDecided) {
     EXPECT_EQ(decision.stringLabel.textOr(""), slot == 1 ? "period" : "size");
     EXPECT_EQ(decision.stringValue.textOr("absent"), slot == 1 ? "absent" : "huge");
     EXPECT_FALSE(decision.specialRule);
-    point.string1Value = "week";
+    point.strings[0].second = "week";
   }
   const FilterDecision tooShort = filter->inspectTesselObject(*faultyObject({kDuration}));
   EXPECT_EQ(tooShort.durationSeconds, -0.001F);
@@ -147,8 +144,7 @@ TestPoint perfLoggingPoint(TestPoint::Text component, TestPoint::Text action) {
   point.subsystem = "com.vantor.PerformanceAnalysis";
   point.category = "PerfLogging";
   point.name = "PerfLoggingOperation";
-  point.string1Value = std::move(component);
-  point.string2Value = std::move(action);
+  point.strings = {{{{}, std::move(component)}, {{}, std::move(action)}}};
   return point;
 }
 
@@ -180,14 +176,14 @@ TEST_F(ObjectFilterTest, QuarroHasARuleOfItsOwnOnEveryBuild) {
 
 TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
   TestPoint point = perfLoggingPoint("ApplicationWindow", "Open");
-  point.string1Name = "component";
-  point.string2Name = "action";
+  point.strings[0].first = "component";
+  point.strings[1].first = "action";
   EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
   // On another platform it is an object like any other, and these are no values of that platform.
   EXPECT_FALSE(filter->shouldReportTesselObject(*makeEvent(point), nullptr));
   // Of another name it is one on Quarro, too, where both values are known.
   point.name = "Other";
-  point.string1Value = "Open";
+  point.strings[0].second = "Open";
   EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
 }
 
@@ -205,10 +201,7 @@ TEST_F(ObjectFilterTest, ASlotIsTestedOnlyWhereItIsLabelled) {
                {"label", "2,2,1,0", "", "Root", true}};
   for (const auto& row : cases) {
     TestPoint point;
-    point.string1Name = row.label1;
-    point.string1Value = row.value1;
-    point.string2Name = row.label2;
-    point.string2Value = row.value2;
+    point.strings = {{{row.label1, row.value1}, {row.label2, row.value2}}};
     const auto object = makeEvent(point);
     variant.internal = false;
     EXPECT_EQ(filter->shouldReportTesselObject(*object, nullptr), row.passes)
@@ -245,10 +238,7 @@ TestPoint anyPoint(std::mt19937& random) {
   if (chance(20)) point.category = {};
   point.telemetryEnabled = !chance(5);
   point.durationSeconds = chance(5) ? -1.0F : 1.0F;
-  if (chance(2)) {
-    point.string1Name = "period";
-    point.string1Value = chance(3) ? "never" : "day";
-  }
+  if (chance(2)) point.strings[0] = {"period", chance(3) ? "never" : "day"};
   return point;
 }
 

@@ -15,19 +15,31 @@ const SharedString& unknownText() {
   return text;
 }
 
-// An absent label keeps its value out, too; an absent value keeps out only itself.
-void setLabelled(Payload& payload, std::string_view labelKey, StringRef label,
-                 std::string_view valueKey, StringRef value) {
-  if (!label.present()) return;
-  payload.set(labelKey, label);
-  payload.set(valueKey, value);
-}
+struct SlotKeys {
+  std::string_view label;
+  std::string_view value;
+};
 
-void setLabelled(Payload& payload, std::string_view labelKey, StringRef label,
-                 std::string_view valueKey, const std::optional<Number>& value) {
-  if (!label.present()) return;
-  payload.set(labelKey, label);
-  if (value) payload.set(valueKey, *value);
+// By slot. Spelled out, because a payload keeps views of its keys: they must be literals.
+constexpr std::array<SlotKeys, kLabelledStrings> kStringKeys = {
+    {{"String1Name", "String1Value"}, {"String2Name", "String2Value"}}};
+constexpr std::array<SlotKeys, kLabelledNumbers> kNumberKeys = {
+    {{"Number1Name", "Number1Value"}, {"Number2Name", "Number2Value"}}};
+
+// A value without its label says nothing to a reader of the event, so it stays out with the label.
+void setLabelledArguments(Payload& payload, const TesselObject& object) {
+  for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
+    const LabelledString& string = object.labelledStrings()[slot];
+    if (!string.label.present()) continue;
+    payload.set(kStringKeys[slot].label, string.label);
+    payload.set(kStringKeys[slot].value, string.value);
+  }
+  for (size_t slot = 0; slot < kLabelledNumbers; ++slot) {
+    const LabelledNumber& number = object.labelledNumbers()[slot];
+    if (!number.label.present()) continue;
+    payload.set(kNumberKeys[slot].label, number.label);
+    if (number.value) payload.set(kNumberKeys[slot].value, *number.value);
+  }
 }
 
 // A bundle identifier says more than the process name that the event carries, so it wins.
@@ -55,10 +67,7 @@ std::optional<Payload> TesselObject::statoraPayload(ProcessIdentity&) const {
   payload.set("Subsystem", subsystem());
   payload.set("Category", category());
   payload.set("Name", name().present() ? SharedString(name()) : unknownText());
-  setLabelled(payload, "String1Name", string1Name(), "String1Value", string1Value());
-  setLabelled(payload, "String2Name", string2Name(), "String2Value", string2Value());
-  setLabelled(payload, "Number1Name", number1Name(), "Number1Value", number1Value());
-  setLabelled(payload, "Number2Name", number2Name(), "Number2Value", number2Value());
+  setLabelledArguments(payload, *this);
   payload.set("IntervalType", SharedString(tesselType()));
   payload.set("DurationInSeconds", Number(durationSeconds()));
   return payload;

@@ -12,6 +12,7 @@
 
 #pragma once
 
+#include <array>
 #include <memory>
 #include <optional>
 #include <string_view>
@@ -50,23 +51,30 @@ class TesselSupportObject {
   const TesselClass class_ = TesselClass::supportObject;
 };
 
-// What every trace point carries. Strings are borrowed from `strings`.
+// Arguments that a writer labels. A value counts only where its label is present.
+struct LabelledString {
+  StringRef label;
+  StringRef value;
+};
+struct LabelledNumber {
+  StringRef label;
+  std::optional<Number> value;
+};
+
+// What every trace point carries. Strings are borrowed from `pool`.
 struct TracePointFields {
-  std::shared_ptr<const StringPool> strings;
+  std::shared_ptr<const StringPool> pool;
   StringRef subsystem;
   StringRef category;
   StringRef name;
-  StringRef string1Name;
-  StringRef string1Value;
-  StringRef string2Name;
-  StringRef string2Value;
-  StringRef number1Name;
-  std::optional<Number> number1Value;
-  StringRef number2Name;
-  std::optional<Number> number2Value;
+  std::array<LabelledString, 2> strings;
+  std::array<LabelledNumber, 2> numbers;
   float durationSeconds = 0;  // seconds
   bool telemetryEnabled = false;
 };
+
+inline constexpr size_t kLabelledStrings = std::tuple_size_v<decltype(TracePointFields::strings)>;
+inline constexpr size_t kLabelledNumbers = std::tuple_size_v<decltype(TracePointFields::numbers)>;
 
 class TesselObject : public TesselSupportObject {
  public:
@@ -76,14 +84,17 @@ class TesselObject : public TesselSupportObject {
   StringRef subsystem() const { return fields_.subsystem; }
   StringRef category() const { return fields_.category; }
   StringRef name() const { return fields_.name; }
-  StringRef string1Name() const { return fields_.string1Name; }
-  StringRef string1Value() const { return fields_.string1Value; }
-  StringRef string2Name() const { return fields_.string2Name; }
-  StringRef string2Value() const { return fields_.string2Value; }
-  StringRef number1Name() const { return fields_.number1Name; }
-  const std::optional<Number>& number1Value() const { return fields_.number1Value; }
-  StringRef number2Name() const { return fields_.number2Name; }
-  const std::optional<Number>& number2Value() const { return fields_.number2Value; }
+  // All labelled arguments; slot 1 of the accessors below is index 0.
+  const auto& labelledStrings() const { return fields_.strings; }
+  const auto& labelledNumbers() const { return fields_.numbers; }
+  StringRef string1Name() const { return fields_.strings[0].label; }
+  StringRef string1Value() const { return fields_.strings[0].value; }
+  StringRef string2Name() const { return fields_.strings[1].label; }
+  StringRef string2Value() const { return fields_.strings[1].value; }
+  StringRef number1Name() const { return fields_.numbers[0].label; }
+  const std::optional<Number>& number1Value() const { return fields_.numbers[0].value; }
+  StringRef number2Name() const { return fields_.numbers[1].label; }
+  const std::optional<Number>& number2Value() const { return fields_.numbers[1].value; }
   float durationSeconds() const { return fields_.durationSeconds; }
   bool telemetryEnabled() const { return fields_.telemetryEnabled; }
 

@@ -29,14 +29,8 @@ class StatoraReportingTest : public ::testing::Test {
 
 TEST_F(StatoraReportingTest, EveryValueOfAnEventStandsUnderItsKeyInOrder) {
   TestPoint point;
-  point.string1Name = "period";
-  point.string1Value = "week";
-  point.string2Name = "size";
-  point.string2Value = "small";
-  point.number1Name = "count";
-  point.number1Value = Number(uint64_t{18446744073709551615u});
-  point.number2Name = "share";
-  point.number2Value = Number(0.1);
+  point.strings = {{{"period", "week"}, {"size", "small"}}};
+  point.numbers = {{{"count", uint64_t{18446744073709551615u}}, {"share", 0.1}}};
   point.durationSeconds = 0.1F;
   point.beginProcessName = "Calendar";
   EXPECT_EQ(
@@ -52,19 +46,15 @@ TEST_F(StatoraReportingTest, AbsentValuesAreLeftOutOrUnknown) {
   TestPoint point;
   point.subsystem = point.category = point.name = {};
   // A value without its label, and a label without its value.
-  point.string1Value = "week";
-  point.string2Name = "size";
-  point.number1Value = Number(int64_t{1});
-  point.number2Name = "share";
+  point.strings = {{{{}, "week"}, {"size", {}}}};
+  point.numbers = {{{{}, int64_t{1}}, {"share", {}}}};
   EXPECT_EQ(json(*makeEvent(point)),
             R"({"Name":"Unknown","String2Name":"size","Number2Name":"share",)"
             R"("IntervalType":"Event","DurationInSeconds":0,"StartProcessName":"Unknown"})");
   // And the other way round.
   point = {};
-  point.string1Name = "period";
-  point.string2Value = "small";
-  point.number1Name = "count";
-  point.number2Value = Number(int64_t{1});
+  point.strings = {{{"period", {}}, {{}, "small"}}};
+  point.numbers = {{{"count", {}}, {{}, int64_t{1}}}};
   EXPECT_EQ(json(*makeObject(point)),
             R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
             R"("String1Name":"period","Number1Name":"count",)"

@@ -12,6 +12,13 @@ FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }
 
+// The kinds of the labelled arguments stand in the order label, value, label, value.
+constexpr FieldKind inSlot(FieldKind ofFirstSlot, size_t slot) {
+  return static_cast<FieldKind>(static_cast<size_t>(ofFirstSlot) + 2 * slot);
+}
+static_assert(inSlot(FieldKind::string1Name, kLabelledStrings) == FieldKind::number1Name &&
+              inSlot(FieldKind::number1Name, kLabelledNumbers) == FieldKind::duration);
+
 }  // namespace
 
 IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
@@ -150,18 +157,18 @@ TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
   const auto number = [&](FieldKind kind) { return table_.number(tokenOf(tokens, kind)); };
   const FieldToken duration = tokenOf(tokens, FieldKind::duration);
   TracePointFields fields;
-  fields.strings = table_.strings();
+  fields.pool = table_.strings();
   fields.subsystem = text(FieldKind::subsystem);
   fields.category = text(FieldKind::category);
   fields.name = text(FieldKind::name);
-  fields.string1Name = text(FieldKind::string1Name);
-  fields.string1Value = text(FieldKind::string1Value);
-  fields.string2Name = text(FieldKind::string2Name);
-  fields.string2Value = text(FieldKind::string2Value);
-  fields.number1Name = text(FieldKind::number1Name);
-  fields.number1Value = number(FieldKind::number1Value);
-  fields.number2Name = text(FieldKind::number2Name);
-  fields.number2Value = number(FieldKind::number2Value);
+  for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
+    fields.strings[slot] = {text(inSlot(FieldKind::string1Name, slot)),
+                            text(inSlot(FieldKind::string1Value, slot))};
+  }
+  for (size_t slot = 0; slot < kLabelledNumbers; ++slot) {
+    fields.numbers[slot] = {text(inSlot(FieldKind::number1Name, slot)),
+                            number(inSlot(FieldKind::number1Value, slot))};
+  }
   fields.durationSeconds = duration == kNoToken ? measuredSeconds : table_.real(duration);
   fields.telemetryEnabled = table_.flag(tokenOf(tokens, FieldKind::telemetry));
   return fields;

@@ -15,20 +15,18 @@ struct Texts {
 };
 
 TracePointFields fieldsOf(const TestPoint& point, const Texts& texts) {
-  return {.strings = texts.pool,
-          .subsystem = texts(point.subsystem),
-          .category = texts(point.category),
-          .name = texts(point.name),
-          .string1Name = texts(point.string1Name),
-          .string1Value = texts(point.string1Value),
-          .string2Name = texts(point.string2Name),
-          .string2Value = texts(point.string2Value),
-          .number1Name = texts(point.number1Name),
-          .number1Value = point.number1Value,
-          .number2Name = texts(point.number2Name),
-          .number2Value = point.number2Value,
-          .durationSeconds = point.durationSeconds,
-          .telemetryEnabled = point.telemetryEnabled};
+  TracePointFields fields;
+  fields.pool = texts.pool;
+  fields.subsystem = texts(point.subsystem);
+  fields.category = texts(point.category);
+  fields.name = texts(point.name);
+  for (size_t slot = 0; slot < kLabelledStrings; ++slot)
+    fields.strings[slot] = {texts(point.strings[slot].first), texts(point.strings[slot].second)};
+  for (size_t slot = 0; slot < kLabelledNumbers; ++slot)
+    fields.numbers[slot] = {texts(point.numbers[slot].first), point.numbers[slot].second};
+  fields.durationSeconds = point.durationSeconds;
+  fields.telemetryEnabled = point.telemetryEnabled;
+  return fields;
 }
 
 EmittingProcess beginOf(const TestPoint& point, const Texts& texts) {

@@ -15,9 +15,8 @@ struct TestPoint {
   Text subsystem = "com.vantor.Calendar";
   Text category = "View";
   Text name = "Open";
-  Text string1Name, string1Value, string2Name, string2Value;
-  Text number1Name, number2Name;
-  std::optional<Number> number1Value, number2Value;
+  std::array<std::pair<Text, Text>, kLabelledStrings> strings;  // label and value
+  std::array<std::pair<Text, std::optional<Number>>, kLabelledNumbers> numbers;
   float durationSeconds = 0;
   bool telemetryEnabled = true;
   Text beginImagePath, beginProcessName;  // the event's own where it is one

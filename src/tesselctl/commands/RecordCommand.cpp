@@ -164,15 +164,22 @@ int recordPoint(RecordOptions& options, const std::string& kind) {
   return failure ? fail(failure->status, failure->message) : kDone;
 }
 
+template <size_t N>
+void addSlotOptions(CLI::App& app, const std::string& name,
+                    std::array<std::optional<std::string>, N>& pairs, const std::string& what) {
+  static constexpr const char* kOrdinals[] = {"First", "Second"};
+  static_assert(N <= std::size(kOrdinals));
+  for (size_t slot = 0; slot < N; ++slot) {
+    app.add_option(name + std::to_string(slot + 1), pairs[slot], kOrdinals[slot] + what)
+        ->type_name("LABEL=VALUE");
+  }
+}
+
 void addPointOptions(CLI::App& app, RecordedPoint& point) {
   app.add_flag("--telemetry", point.telemetry,
                "Mark it for telemetry; what is not marked is never reported");
-  app.add_option("--string1", point.strings[0], "First labelled string")->type_name("LABEL=VALUE");
-  app.add_option("--string2", point.strings[1], "Second labelled string")->type_name("LABEL=VALUE");
-  app.add_option("--number1", point.numbers[0], "First labelled number, decimal")
-      ->type_name("LABEL=VALUE");
-  app.add_option("--number2", point.numbers[1], "Second labelled number, decimal")
-      ->type_name("LABEL=VALUE");
+  addSlotOptions(app, "--string", point.strings, " labelled string");
+  addSlotOptions(app, "--number", point.numbers, " labelled number, decimal");
   app.add_option("--duration", point.duration, "Duration to state in place of the measured one")
       ->type_name("SECONDS");
   app.add_option("--frame-rate", point.frameRate,

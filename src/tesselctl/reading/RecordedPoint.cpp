@@ -28,7 +28,13 @@ class FieldList {
   void add(const std::string& name, const std::optional<std::string>& value) {
     if (value) add(name, *value);
   }
-  // LABEL=VALUE as the two fields of a slot.
+  // Each LABEL=VALUE as the two fields of its slot, such as TESSEL_STRING1_NAME and ..._VALUE.
+  template <size_t N>
+  void addSlots(const std::string& kind, const std::array<std::optional<std::string>, N>& pairs,
+                bool number) {
+    for (size_t slot = 0; slot < N; ++slot)
+      addSlot(kind + std::to_string(slot + 1), pairs[slot], number);
+  }
   void addSlot(const std::string& slot, const std::optional<std::string>& pair, bool number) {
     if (!pair) return;
     const size_t equals = pair->find('=');
@@ -96,10 +102,8 @@ std::variant<std::vector<RecordedField>, std::string> fieldsOf(const RecordedPoi
   list.add("TESSEL_INTERVAL_ID", point.id);
   list.add("TESSEL_INTERVAL_SCOPE", point.scope);
   if (point.telemetry) list.add("TESSEL_TELEMETRY", std::string("1"));
-  list.addSlot("STRING1", point.strings[0], false);
-  list.addSlot("STRING2", point.strings[1], false);
-  list.addSlot("NUMBER1", point.numbers[0], true);
-  list.addSlot("NUMBER2", point.numbers[1], true);
+  list.addSlots("STRING", point.strings, false);
+  list.addSlots("NUMBER", point.numbers, true);
   list.addDecimal("TESSEL_DURATION", point.duration);
   list.addDecimal("TESSEL_FRAME_RATE", point.frameRate);
   list.addAttributes(point.attributes);

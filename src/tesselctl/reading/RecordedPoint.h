@@ -2,12 +2,14 @@
 
 #pragma once
 
+#include <array>
 #include <optional>
 #include <string>
 #include <variant>
 #include <vector>
 
 #include "journal/ExportFile.h"
+#include "objects/TesselObject.h"
 
 namespace tessel::ctl {
 
@@ -18,8 +20,8 @@ struct RecordedPoint {
   std::optional<std::string> id;
   std::optional<std::string> scope;
   bool telemetry = false;
-  std::optional<std::string> strings[2];  // LABEL=VALUE
-  std::optional<std::string> numbers[2];  // LABEL=VALUE
+  std::array<std::optional<std::string>, kLabelledStrings> strings;  // LABEL=VALUE
+  std::array<std::optional<std::string>, kLabelledNumbers> numbers;  // LABEL=VALUE
   std::optional<std::string> duration;
   std::optional<std::string> frameRate;
   std::vector<std::string> attributes;  // KEY=VALUE
