@@ -12,7 +12,7 @@
 #include "journal/ExportFile.h"
 #include "journal/JournalSocket.h"
 #include "tesselctl/commands/Commands.h"
-#include "tesselctl/reading/RecordedPoint.h"
+#include "tesselctl/commands/RecordedPoint.h"
 
 extern char** environ;
 

@@ -10,11 +10,11 @@
 #include "os/Files.h"
 #include "service/CookieFile.h"
 #include "tesselctl/commands/Environment.h"
-#include "tesselctl/judging/Losses.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/judging/Verdict.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "tesselctl/showing/JsonLine.h"
+#include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/Terminal.h"
 

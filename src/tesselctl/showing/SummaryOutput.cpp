@@ -4,9 +4,9 @@
 #include <nlohmann/json.hpp>
 
 #include "linux/ReadingDigest.h"
-#include "tesselctl/judging/Losses.h"
 #include "tesselctl/judging/Tally.h"
 #include "tesselctl/showing/JsonLine.h"
+#include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/ShownText.h"
 
 namespace tessel::ctl {

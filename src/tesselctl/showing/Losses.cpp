@@ -1,6 +1,6 @@
 // The words for losses.
 
-#include "tesselctl/judging/Losses.h"
+#include "tesselctl/showing/Losses.h"
 
 #include <algorithm>
 

@@ -1,4 +1,4 @@
-#include "tesselctl/reading/RecordedPoint.h"
+#include "tesselctl/commands/RecordedPoint.h"
 
 #include <algorithm>
 
