@@ -11,9 +11,9 @@
 #include "linux/SystemFacts.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Progress.h"
 #include "tesselctl/showing/ShownText.h"
+#include "tesselctl/showing/SummaryOutput.h"
 
 namespace tessel::ctl {
 
@@ -27,13 +27,13 @@ struct CompareOptions {
 
 // One side of the comparison.
 struct Setting {
-  Judge judge;
+  JudgedMachine machine;
   Period period;
 };
 
 // Reads "Quarro,internal,last=24h"; a word that makes no sense is said and answered with nothing.
 std::optional<Setting> settingOf(const std::string& words, const Reading& usual, Date now) {
-  Setting setting{usual.judge, usual.period};
+  Setting setting{usual.machine, usual.period};
   PeriodArguments period;
   for (size_t begin = 0; begin <= words.size();) {
     const size_t end = std::min(words.find(',', begin), words.size());
@@ -41,9 +41,9 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
     begin = end + 1;
     if (word == "usual") continue;
     if (word == "internal" || word == "no-internal") {
-      setting.judge.internal = word == "internal";
+      setting.machine.internal = word == "internal";
     } else if (const auto platform = platformNamed(word)) {
-      setting.judge.platform = *platform;
+      setting.machine.platform = *platform;
     } else if (word.starts_with("since=")) {
       period.since = word.substr(6);
     } else if (word.starts_with("until=")) {
@@ -126,10 +126,9 @@ struct Comparison {
 
 // Both judge each object of one period.
 void compareJudges(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
-  JudgingFilter judges[2] = {JudgingFilter(settings[0].judge), JudgingFilter(settings[1].judge)};
+  Judge judges[2] = {Judge(settings[0].machine), Judge(settings[1].machine)};
   DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
-    const FilterDecision decisions[2] = {judges[0].filter().inspectTesselObject(object),
-                                         judges[1].filter().inspectTesselObject(object)};
+    const FilterDecision decisions[2] = {judges[0].inspect(object), judges[1].inspect(object)};
     for (size_t side = 0; side < 2; ++side)
       ++comparison.sides[side][decisions[side].classification];
     if (decisions[0].shouldReport() == decisions[1].shouldReport()) return true;
@@ -170,9 +169,9 @@ std::string mainReason(const VerdictCounts& counts) {
 void comparePeriods(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
   std::map<Path, PathFigures> paths;
   for (size_t side = 0; side < 2 && !comparison.error; ++side) {
-    JudgingFilter judge(settings[side].judge);
+    Judge judge(settings[side].machine);
     DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
-      const auto verdict = judge.filter().inspectTesselObject(object).classification;
+      const auto verdict = judge.inspect(object).classification;
       ++comparison.sides[side][verdict];
       Path path(textOf(object.subsystem()), textOf(object.category()), textOf(object.name()));
       const auto known = paths.find(path);
@@ -220,8 +219,7 @@ std::string comparisonJson(const Comparison& comparison) {
   for (size_t side = 0; side < 2; ++side) {
     object.nested(side == 0 ? "a" : "b", [&](std::string& inner) {
       JsonObject counts(inner);
-      for (const auto verdict : kVerdictOrder)
-        counts.count(verdictName(verdict), comparison.sides[side][verdict]);
+      addVerdicts(counts, comparison.sides[side]);
       counts.end();
     });
   }

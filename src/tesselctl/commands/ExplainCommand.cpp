@@ -15,11 +15,9 @@
 #include "service/ObjectReporter.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
-#include "tesselctl/judging/Verdict.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Progress.h"
 #include "tesselctl/showing/ShownText.h"
-#include "tesselctl/showing/Terminal.h"
+#include "tesselctl/showing/SummaryOutput.h"
 
 namespace tessel::ctl {
 
@@ -185,7 +183,7 @@ class ExplainRun {
       : options_(options),
         reading_(reading),
         selection_(options),
-        judge_(reading.judge),
+        judge_(reading.machine),
         tally_(reading.period),
         terminal_(terminalBehind(STDOUT_FILENO)),
         lines_(terminal_, reading.period),
@@ -200,13 +198,12 @@ class ExplainRun {
 
  private:
   void inspect(const TesselObject& object, const EntryHeader& entry) {
-    const FilterDecision decision = judge_.filter().inspectTesselObject(object);
+    const FilterDecision decision = judge_.inspect(object);
     if (!selection_.wants(object, decision.classification)) return;
     tally_.count(object, decision, entry);
     if (options_.summary) return;
     const Explanation explanation{
-        object, entry, decision,
-        downsamplingScope(judge_.filter(), object, decision.downsampleEntry),
+        object, entry, decision, judge_.downsamplingScope(object, decision),
         payloads_ && decision.shouldReport() ? payloads_->json(object) : ""};
     if (!options_.json && tally_.traceObjects() == 1) print(lines_.heading());
     print(options_.json ? explanationJson(explanation) : lines_.lines(explanation));
@@ -252,7 +249,7 @@ class ExplainRun {
   const ExplainOptions& options_;
   const Reading& reading_;
   const ObjectSelection selection_;
-  JudgingFilter judge_;
+  Judge judge_;
   Tally tally_;
   const Terminal terminal_;
   const HumanLines lines_;

@@ -58,9 +58,9 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const LaunchConf
            "--platform: '" + terminalText(*options.platform) + "' is none of " + kPlatformNames);
       return {};
     }
-    reading.judge.platform = *platform;
+    reading.machine.platform = *platform;
   }
-  reading.judge.internal =
+  reading.machine.internal =
       options.internal ||
       (!options.external &&
        OsReleaseBuildVariant(launch.osReleasePath).hasInternalDiagnostics(kBuildVariantSubsystem));

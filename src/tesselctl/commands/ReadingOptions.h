@@ -7,6 +7,7 @@
 #include <string>
 
 #include "tesselctl/commands/Environment.h"
+#include "tesselctl/judging/Judge.h"
 #include "tesselctl/reading/DryRun.h"
 #include "tesselctl/reading/TimeArguments.h"
 
@@ -30,7 +31,7 @@ void addJudgeOptions(CLI::App& command, ReadingOptions& options);
 struct Reading {
   std::optional<std::string> store;  // absent: the machine's own journal
   Period period;
-  Judge judge;
+  JudgedMachine machine;
 };
 // Nothing, after a line that names the argument and its value, where they make no sense.
 std::optional<Reading> readingOf(const ReadingOptions& options, const LaunchConfiguration& launch,

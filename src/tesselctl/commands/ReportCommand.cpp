@@ -40,10 +40,10 @@ int write(const std::string& path, const std::string& page) {
 }
 
 int makeReport(const ReportOptions& options, const Reading& reading, ReportFacts facts) {
-  JudgingFilter judge(reading.judge);
+  Judge judge(reading.machine);
   Tally tally(reading.period);
   DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader& entry) {
-    tally.count(object, judge.filter().inspectTesselObject(object), entry);
+    tally.count(object, judge.inspect(object), entry);
     return true;
   });
   ProgressBar bar(true);
@@ -52,8 +52,8 @@ int makeReport(const ReportOptions& options, const Reading& reading, ReportFacts
   bar.clear();
   if (error) return failToRead(error->localizedDescription, reading.store);
   facts.store = reading.store.value_or("the journal of this machine");
-  facts.platform = nameForPlatform(reading.judge.platform);
-  facts.internal = reading.judge.internal;
+  facts.platform = nameForPlatform(reading.machine.platform);
+  facts.internal = reading.machine.internal;
   const int status = write(options.html, htmlReport(tally, run.report(), facts));
   return status == kDone ? warnOfUnreadFiles(run.report().store, reading.store, kDone) : status;
 }

@@ -11,11 +11,11 @@
 #include "service/CookieFile.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/judging/ReporterStatus.h"
-#include "tesselctl/judging/Verdict.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/ShownText.h"
+#include "tesselctl/showing/SummaryOutput.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -33,8 +33,7 @@ void writeRun(std::string& out, const RunRecord& run, bool hasBooks) {
   object.text("outcome", std::string_view(runOutcomeName(run.outcome)));
   if (!run.failure.empty()) object.text("failure", std::string_view(run.failure));
   object.count("log_events", run.logEvents).count("inspected", run.inspected);
-  for (const auto verdict : kVerdictOrder)
-    object.count(verdictName(verdict), run.classified[verdict]);
+  addVerdicts(object, run.classified);
   object.count("unnamed", run.unnamed).count("count_events", run.countEvents);
   object.count("rows_stored", run.rowsStored)
       .count("rows_expected", hasBooks ? run.rowsExpected() : 0);
@@ -282,11 +281,11 @@ class Screen {
     if (!status_.journal.failure.empty()) {
       line("Journal", "unreadable", Colour::bad, status_.journal.failure);
     } else if (!status_.journal.oldest) {
-      line("Journal", "empty", Colour::plain, status_.store);
+      line("Journal", "empty", Colour::plain, storeName(status_.store));
     } else {
       const bool whole = status_.keepsADay();
       line("Journal", whole ? "whole day" : "part of day", whole ? Colour::good : Colour::caution,
-           status_.store + ": oldest entry " + since(*status_.journal.oldest) +
+           storeName(status_.store) + ": oldest entry " + since(*status_.journal.oldest) +
                (whole ? "" : "; a run looks back 24 h"));
     }
   }

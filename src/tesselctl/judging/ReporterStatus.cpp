@@ -11,7 +11,6 @@
 #include "linux/SystemFacts.h"
 #include "os/Files.h"
 #include "service/CookieFile.h"
-#include "tesselctl/commands/Environment.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel::ctl {
@@ -66,7 +65,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch) {
     status.spool = contents.value_or(SpoolContents{});
   }
   status.spoolFailure = spool.reason();
-  status.store = storeName(launch.traceStore);
+  status.store = launch.traceStore;
   status.journal = lookAtJournal(launch.traceStore);
   return status;
 }

@@ -39,7 +39,7 @@ struct ReporterStatus {
   SpoolReader::State spoolState = SpoolReader::State::absent;
   std::string spoolFailure;
   SpoolContents spool;
-  std::string store;
+  std::optional<std::string> store;  // absent: the machine's own journal
   JournalFacts journal;
 
   // A run that got as far as sending anything.

@@ -4,7 +4,7 @@
 
 #include <algorithm>
 #include <ctime>
-#include <numeric>
+#include <tuple>
 
 namespace tessel::ctl {
 
@@ -41,10 +41,6 @@ Date sliceHolding(Date date, microseconds length) {
 std::string textOf(const SharedString& text) { return std::string(text.textOr("")); }
 
 }  // namespace
-
-uint64_t sumOf(const VerdictCounts& counts) {
-  return std::accumulate(counts.begin(), counts.end(), uint64_t{0});
-}
 
 Tally::Tally(const Period& period)
     : period_(period),

@@ -14,16 +14,11 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
+#include "tesselctl/judging/Judge.h"
 #include "tesselctl/judging/KeyedCounts.h"
-#include "tesselctl/judging/Verdict.h"
 #include "tesselctl/reading/TimeArguments.h"
-#include "trace/ExtractionReport.h"
 
 namespace tessel::ctl {
-
-// By classification code.
-using VerdictCounts = std::array<uint64_t, kVerdicts>;
-uint64_t sumOf(const VerdictCounts& counts);
 
 struct KindCounts {
   uint64_t reported = 0;
@@ -94,11 +89,5 @@ class Tally {
   Date firstSlice_;
   std::vector<VerdictCounts> slices_;
 };
-
-// The figures as one JSON object on one line.
-std::string summaryJson(const Tally& tally, const ExtractionReport& report);
-// The figures for a human.
-std::string summaryText(const Tally& tally, const ExtractionReport& report,
-                        const Terminal& terminal);
 
 }  // namespace tessel::ctl

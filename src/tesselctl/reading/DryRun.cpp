@@ -7,7 +7,6 @@
 #include <unordered_map>
 #include <utility>
 
-#include "filter/DefaultDownsampling.h"
 #include "linux/SystemFacts.h"
 
 namespace tessel::ctl {
@@ -117,12 +116,6 @@ uint64_t microsecondsSince1970(Date date) {
 }
 
 }  // namespace
-
-JudgingFilter::JudgingFilter(const Judge& judge)
-    : variant_(std::make_unique<FixedVariant>(judge.internal)),
-      filter_(TesselReporterObjectFilter::initWithPlatform(judge.platform, *variant_)) {
-  filter_->setScnFilter(makeDefaultFilterForPlatform(judge.platform));
-}
 
 DryRun::DryRun(std::optional<std::string> store, Visitor visitor)
     : store_(std::move(store)), visitor_(std::move(visitor)) {

@@ -13,40 +13,11 @@
 #include <optional>
 #include <string>
 
-#include "filter/TesselReporterObjectFilter.h"
 #include "journal/TraceStore.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "trace/JournalExtractor.h"
 
 namespace tessel::ctl {
-
-// For whom the filter judges.
-struct Judge {
-  TesselReporterPlatform platform = currentPlatform();
-  bool internal = false;  // a build with internal diagnostics
-
-  bool operator==(const Judge&) const = default;
-};
-
-// A filter of its own with fresh counters, and the build variant that it asks.
-class JudgingFilter {
- public:
-  // REQUIRES: judge.platform is not unknown.
-  explicit JudgingFilter(const Judge& judge);
-
-  TesselReporterObjectFilter& filter() { return *filter_; }
-  const TesselReporterObjectFilter& filter() const { return *filter_; }
-
- private:
-  struct FixedVariant final : BuildVariant {
-    explicit FixedVariant(bool answer) : internal(answer) {}
-    bool hasInternalDiagnostics(std::string_view /*subsystem*/) override { return internal; }
-    const bool internal;
-  };
-
-  std::unique_ptr<FixedVariant> variant_;
-  std::shared_ptr<TesselReporterObjectFilter> filter_;
-};
 
 class DryRun {
  public:

@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <ctime>
 
-#include "tesselctl/showing/ShownText.h"
+#include "platform/PlainText.h"
 
 namespace tessel::ctl {
 
@@ -195,7 +195,7 @@ bool eatSuffix(std::string_view& text, std::string_view suffix) {
 
 PeriodResult wrong(std::string_view argument, std::string_view value, std::string_view reason) {
   std::string error(argument);
-  error.append(": '").append(terminalText(value)).append("' ").append(reason);
+  error.append(": '").append(plainText(value, "\\x0a")).append("' ").append(reason);
   return {{}, error};
 }
 

@@ -1,11 +1,11 @@
 // The figures of a dry run as JSON and as tables.
 
+#include "tesselctl/showing/SummaryOutput.h"
+
 #include <algorithm>
 #include <nlohmann/json.hpp>
 
 #include "linux/ReadingDigest.h"
-#include "tesselctl/judging/Tally.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/ShownText.h"
 
@@ -15,6 +15,16 @@ namespace {
 
 constexpr size_t kShownPairs = 20;
 constexpr size_t kShownMisses = 20;
+constexpr size_t kQuotedWidth = 40;  // columns of a value in a sentence
+
+std::string_view meaningOf(TesselReporterClassification verdict) {
+  // By classification code.
+  static constexpr std::string_view kMeanings[kVerdicts] = {
+      "not marked for telemetry",        "reported",
+      "a text value is not a known one", "its duration is negative",
+      "held back by downsampling",       "its kind cannot be reported"};
+  return kMeanings[verdict];
+}
 
 std::string share(uint64_t part, uint64_t whole) {
   if (whole == 0 || part == 0) return "";
@@ -22,15 +32,34 @@ std::string share(uint64_t part, uint64_t whole) {
   return std::to_string(permille / 10) + "." + std::to_string(permille % 10) + " %";
 }
 
-void writeVerdicts(JsonObject& object, const VerdictCounts& counts) {
-  for (const auto verdict : kVerdictOrder) object.count(verdictName(verdict), counts[verdict]);
+std::string quoted(StringRef text) {
+  if (!text) return "none";
+  return "\"" + shortened(terminalText(text.text()), kQuotedWidth) + "\"";
+}
+
+std::string whitelistWords(const FilterDecision& decision) {
+  const std::string slot = "string " + std::to_string(decision.stringSlot);
+  const std::string label = decision.stringLabel ? " " + quoted(decision.stringLabel) : "";
+  if (!decision.stringValue) return slot + label + " has no value";
+  return slot + label + " has the value " + quoted(decision.stringValue) +
+         (decision.specialRule ? ", which the rule for performance logging does not know"
+                               : ", which is not a known value");
+}
+
+std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string& scope) {
+  std::string words = shortened(terminalText(scope), kQuotedWidth);
+  if (entry.cap() == 0) return words + " is never reported";
+  words += ": one in " + grouped(entry.downsampleRatio()) + ", at most " + grouped(entry.cap()) +
+           "; this is number " + grouped(entry.eventsSeen()) + ", " +
+           grouped(entry.eventsReported()) + " reported so far";
+  return words;
 }
 
 void writePair(std::string& out, const Tally::Pair& pair) {
   JsonObject object(out);
   object.text("subsystem", std::string_view(pair.subsystem))
       .text("category", std::string_view(pair.category));
-  writeVerdicts(object, pair.counts);
+  addVerdicts(object, pair.counts);
   object.end();
 }
 
@@ -94,7 +123,7 @@ std::string verdictTable(const Tally& tally, const Terminal& terminal) {
         {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
          grouped(count),
          share(count, tally.traceObjects()),
-         std::string(verdictMeaning(verdict))});
+         std::string(meaningOf(verdict))});
   }
   return table.render(terminal, 2);
 }
@@ -223,13 +252,60 @@ std::string fileLines(const StoreReport& store, const Terminal& terminal) {
 
 }  // namespace
 
+Colour verdictColour(TesselReporterClassification classification) {
+  // By classification code.
+  static constexpr Colour kColours[kVerdicts] = {Colour::faint,   Colour::good,    Colour::bad,
+                                                 Colour::caution, Colour::caution, Colour::caution};
+  return kColours[classification];
+}
+
+void addVerdicts(JsonObject& object, const VerdictCounts& counts) {
+  for (const auto verdict : kVerdictOrder) object.count(verdictName(verdict), counts[verdict]);
+}
+
+std::string ruleJson(const FilterDecision& decision, const std::string& scope) {
+  std::string out;
+  JsonObject rule(out);
+  if (decision.classification == TesselReporterClassificationFailedStringWhitelist) {
+    rule.count("slot", decision.stringSlot)
+        .text("label", decision.stringLabel)
+        .text("value", decision.stringValue);
+    if (decision.specialRule) rule.boolean("special", true);
+  } else if (decision.classification == TesselReporterClassificationDurationThreshold) {
+    rule.number("duration", Number{decision.durationSeconds});
+  } else if (decision.downsampleEntry != nullptr) {
+    rule.text("scope", std::string_view(scope))
+        .count("cap", decision.downsampleEntry->cap())
+        .count("ratio", decision.downsampleEntry->downsampleRatio())
+        .count("seen", decision.downsampleEntry->eventsSeen())
+        .count("reported", decision.downsampleEntry->eventsReported());
+  } else {
+    return {};
+  }
+  rule.end();
+  return out;
+}
+
+std::string ruleWords(const FilterDecision& decision, const std::string& scope) {
+  switch (decision.classification) {
+    case TesselReporterClassificationFailedStringWhitelist:
+      return whitelistWords(decision);
+    case TesselReporterClassificationDurationThreshold:
+      return "its duration is " + numberText(Number{decision.durationSeconds}) + " s";
+    default:
+      return decision.downsampleEntry == nullptr
+                 ? ""
+                 : downsamplingWords(*decision.downsampleEntry, scope);
+  }
+}
+
 std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
   std::string out;
   JsonObject object(out);
   object.count("log_events", report.entriesRead).count("trace_objects", tally.traceObjects());
   object.nested("verdicts", [&](std::string& inner) {
     JsonObject verdicts(inner);
-    writeVerdicts(verdicts, tally.verdicts());
+    addVerdicts(verdicts, tally.verdicts());
     verdicts.end();
   });
   object.nested("kinds", [&](std::string& inner) { writeKinds(inner, tally); });
