@@ -8,12 +8,12 @@ namespace tessel {
 
 namespace {
 
-// Where a pair starts probing. Not the key's hash: exclusive or puts every pair of two equal
-// strings on 0, and a writer is free to record nothing else.
-size_t firstSlot(StringRef subsystem, StringRef category) {
+// The hash under which a pair is found. The key's own hash() will not do: exclusive or makes it 0
+// for every pair of two equal strings, and a writer is free to record nothing else.
+uint32_t hashOf(StringRef subsystem, StringRef category) {
   constexpr uint64_t kOdd = 0x9e3779b97f4a7c15u;
   const uint64_t mixed = subsystem.hash() * kOdd + category.hash();
-  return mixed ^ (mixed >> 32);
+  return static_cast<uint32_t>(mixed ^ (mixed >> 32));
 }
 
 bool bothPresent(StringRef subsystem, StringRef category) {
@@ -40,19 +40,13 @@ void TesselReporterAggregation::incrementSubsystem(StringRef subsystem, StringRe
     entries_.push_back({Key(subsystem, category), 1});
     return;
   }
-  if (slots_.empty()) makeRoom();
-  size_t slot = slotFor(subsystem, category);
-  if (slots_[slot] != 0) {
-    ++entries_[slots_[slot] - 1].count;
-    return;
-  }
-  if ((slotsTaken_ + 1) * 2 > slots_.size()) {
-    makeRoom();
-    slot = slotFor(subsystem, category);
-  }
-  entries_.push_back({Key(subsystem, category), 1});
-  slots_[slot] = static_cast<Index>(entries_.size());
-  ++slotsTaken_;
+  const auto add = [&] {
+    entries_.push_back({Key(subsystem, category), 0});
+    return static_cast<uint32_t>(entries_.size() - 1);
+  };
+  const uint32_t number =
+      index_.findOrAdd(hashOf(subsystem, category), isPair(subsystem, category), add);
+  ++entries_[number].count;
 }
 
 uint64_t TesselReporterAggregation::countForSubsystem(StringRef subsystem,
@@ -81,30 +75,11 @@ TesselReporterAggregation::keysInDescendingCountOrder() const {
   return keys;
 }
 
-size_t TesselReporterAggregation::slotFor(StringRef subsystem, StringRef category) const {
-  const size_t mask = slots_.size() - 1;
-  size_t slot = firstSlot(subsystem, category) & mask;
-  for (; slots_[slot] != 0; slot = (slot + 1) & mask) {
-    const Key& key = entries_[slots_[slot] - 1].key;
-    if (sameString(key.subsystem(), subsystem) && sameString(key.category(), category)) break;
-  }
-  return slot;
-}
-
 const TesselReporterAggregation::Entry* TesselReporterAggregation::find(StringRef subsystem,
                                                                         StringRef category) const {
-  if (slots_.empty() || !bothPresent(subsystem, category)) return nullptr;
-  const Index index = slots_[slotFor(subsystem, category)];
-  return index == 0 ? nullptr : &entries_[index - 1];
-}
-
-void TesselReporterAggregation::makeRoom() {
-  slots_.assign(slots_.empty() ? 16 : slots_.size() * 2, 0);
-  for (size_t index = 0; index < entries_.size(); ++index) {
-    const Key& key = entries_[index].key;
-    if (!bothPresent(key.subsystem(), key.category())) continue;
-    slots_[slotFor(key.subsystem(), key.category())] = static_cast<Index>(index + 1);
-  }
+  if (!bothPresent(subsystem, category)) return nullptr;
+  const uint32_t number = index_.find(hashOf(subsystem, category), isPair(subsystem, category));
+  return number == FlatIndex::kNone ? nullptr : &entries_[number];
 }
 
 }  // namespace tessel

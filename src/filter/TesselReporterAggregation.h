@@ -13,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/FlatIndex.h"
 #include "platform/SharedString.h"
 
 namespace tessel {
@@ -67,18 +68,18 @@ class TesselReporterAggregation {
   const std::deque<Entry>& aggregationDictionary() const { return entries_; }
 
  private:
-  using Index = uint32_t;
-  // The slot of the pair, or the free one where it belongs. REQUIRES: both strings present.
-  size_t slotFor(StringRef subsystem, StringRef category) const;
+  // Says of the number of an entry whether the entry is that of the pair.
+  auto isPair(StringRef subsystem, StringRef category) const {
+    return [=, this](uint32_t number) {
+      const Key& key = entries_[number].key;
+      return sameString(key.subsystem(), subsystem) && sameString(key.category(), category);
+    };
+  }
   const Entry* find(StringRef subsystem, StringRef category) const;
-  void makeRoom();
 
   // A deque, so that keys stay where they are and no capacity for twice the pairs lies idle.
   std::deque<Entry> entries_;
-  // Open addressing over the entries whose strings are present: one above the entry's index, 0 for
-  // a free slot. The size is 0 or a power of two, and at most half of the slots are taken.
-  std::vector<Index> slots_;
-  size_t slotsTaken_ = 0;
+  FlatIndex index_;  // of the entries whose strings are present
   uint64_t totalCount_ = 0;
 };
 

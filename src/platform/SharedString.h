@@ -19,6 +19,8 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/FlatIndex.h"
+
 namespace tessel {
 
 // 64-bit hash of `text`, seeded once per process, so that a writer cannot choose collisions.
@@ -110,7 +112,7 @@ inline bool sameString(StringRef a, StringRef b) {
 }
 inline bool sameString(StringRef a, std::string_view b) { return a.present() && a.text() == b; }
 
-// Stores each distinct text once and lends it out; an open-addressing table of records.
+// Stores each distinct text once and lends it out.
 class StringPool {
  public:
   StringPool() = default;
@@ -126,24 +128,20 @@ class StringPool {
   StringRef intern(std::string_view text) { return internNoted(text).string; }
   // The same, with a number that the pool keeps for its user beside each string, 0 at first.
   Noted internNoted(std::string_view text);
-  size_t size() const { return size_; }
-  // Bytes held by texts, records and the table.
-  size_t memoryUsed() const { return textBytes_ + slots_.capacity() * sizeof(Slot); }
+  size_t size() const { return strings_.size(); }
+  // Bytes held by the texts, their records and the bookkeeping of both.
+  size_t memoryUsed() const {
+    return textBytes_ + strings_.capacity() * sizeof(Kept) + index_.memoryUsed();
+  }
 
  private:
-  // The lower half of the hash stands beside the string, so that a search seldom looks at another
-  // record than the one it is for, and growing at none. A pool has fewer slots than that has
-  // values.
-  struct Slot {
+  struct Kept {
     SharedString string;
-    uint32_t hash = 0;
     uint32_t note = 0;
   };
 
-  void grow();
-
-  std::vector<Slot> slots_;
-  size_t size_ = 0;
+  std::vector<Kept> strings_;
+  FlatIndex index_;  // of strings_
   size_t textBytes_ = 0;
 };
 

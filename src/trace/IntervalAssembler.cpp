@@ -98,10 +98,9 @@ void IntervalAssembler::emitEvent() {
 }
 
 void IntervalAssembler::begin(const EntryHeader& header) {
-  const size_t before = open_.size();
-  const uint64_t droppedBefore = open_.dropped();
-  open_.open(keyOf(header), header.monotonic, point_.tokens, point_.attributes);
-  if (open_.size() == before && open_.dropped() == droppedBefore) ++counts_.replacedBegins;
+  const bool replaced =
+      open_.open(keyOf(header), header.monotonic, point_.tokens, point_.attributes);
+  if (replaced) ++counts_.replacedBegins;
 }
 
 void IntervalAssembler::end(const EntryHeader& header) {

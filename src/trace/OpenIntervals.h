@@ -1,8 +1,9 @@
 // OpenIntervals: the begins that wait for their end.
 //
-// A hash table on small integers over a slab of begins, which also stand in a list by age: over
-// the limits the oldest goes. What the table takes is memory for as many begins as were ever open
-// at once.
+// The begins stand in a slab, an index finds them by their key, and a list links them by age: over
+// the limits the oldest goes, because the end that is longest overdue is the least likely to come.
+// A begin that replaces another counts as the youngest, for the same reason: its end is due from
+// now on. The memory is that of as many begins as were ever open at once.
 //
 // Threads: one at a time.
 
@@ -11,9 +12,11 @@
 #include <array>
 #include <compare>
 #include <cstdint>
+#include <functional>
 #include <vector>
 
 #include "journal/EntryStream.h"
+#include "platform/FlatIndex.h"
 #include "trace/TracePointFields.h"
 
 namespace tessel {
@@ -41,6 +44,9 @@ struct OpenInterval {
   std::vector<FieldToken> attributes;
 };
 
+// A writer that begins intervals and never ends them must not take our memory. 65,536 begins of 160
+// bytes are 10 MiB, far more than a machine has under way at once. An attribute is a token of 4
+// bytes, so 262,144 of them are 1 MiB: room for four on each of that many begins.
 struct OpenIntervalLimits {
   size_t intervals = 65'536;
   size_t attributes = 262'144;  // of all open intervals together
@@ -50,68 +56,45 @@ class OpenIntervals {
  public:
   explicit OpenIntervals(OpenIntervalLimits limits = {});
 
-  // Opens an interval; one that is open under the same key is replaced and counts as the youngest.
-  void open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
+  // Opens an interval. Answers whether one was open under the same key, which it replaces.
+  bool open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
             const std::vector<FieldToken>& attributes);
   // The open interval under `key`, or null; valid until the next call that is not const.
   const OpenInterval* find(const IntervalKey& key) const;
   // REQUIRES: `interval` was answered by find().
   void close(const OpenInterval* interval);
 
-  // Calls `renew(OpenInterval&)`, which may change the key, on each from the youngest to the
-  // oldest; from the first that answers false on, they are dropped.
-  template <typename Renew>
-  void renewAll(Renew&& renew);
+  // Calls `renew`, which may change the key, on each interval from the youngest to the oldest. The
+  // first for which it answers false is dropped, and so are all that are older.
+  void renewAll(const std::function<bool(OpenInterval&)>& renew);
 
   size_t size() const { return size_; }
   // How many gave way to younger ones.
   uint64_t dropped() const { return dropped_; }
 
  private:
-  static constexpr uint32_t kNone = ~uint32_t{0};
-  struct Node {
-    OpenInterval interval;
-    uint32_t hash = 0;
-    uint32_t older = kNone;
+  static constexpr uint32_t kNone = FlatIndex::kNone;
+  struct Node : OpenInterval {
+    uint32_t hash = 0;       // of the key
+    uint32_t older = kNone;  // of a free node: the next free one
     uint32_t younger = kNone;
   };
-  struct Slot {
-    uint32_t hash = 0;
-    uint32_t node = kNone;
-  };
 
-  uint32_t hashOf(const IntervalKey& key) const;
-  size_t slotOf(const IntervalKey& key, uint32_t hash) const;
+  uint32_t numberOf(const IntervalKey& key, uint32_t hash) const;
   uint32_t newNode();
-  void insertSlot(uint32_t node);
-  void eraseSlot(size_t at);
-  void grow();
-  void link(uint32_t node);
-  void remove(uint32_t node);
-  void removeAt(size_t slot);
-  void dropFrom(uint32_t node);
-  void rehash();
+  void link(uint32_t number);
+  void remove(uint32_t number);
+  void release(uint32_t number);
 
   const OpenIntervalLimits limits_;
-  const uint64_t seed_;
   std::vector<Node> nodes_;
-  std::vector<uint32_t> free_;
-  std::vector<Slot> slots_;
+  FlatIndex index_;  // of nodes_, by the key
+  uint32_t free_ = kNone;
   uint32_t oldest_ = kNone;
   uint32_t youngest_ = kNone;
-  size_t size_ = 0;
+  size_t size_ = 0;  // of the list by age
   size_t attributes_ = 0;
   uint64_t dropped_ = 0;
 };
-
-template <typename Renew>
-void OpenIntervals::renewAll(Renew&& renew) {
-  for (uint32_t at = youngest_; at != kNone; at = nodes_[at].older) {
-    if (renew(nodes_[at].interval)) continue;
-    dropFrom(at);
-    break;
-  }
-  rehash();
-}
 
 }  // namespace tessel

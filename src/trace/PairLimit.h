@@ -10,6 +10,7 @@
 #include <cstdint>
 #include <vector>
 
+#include "platform/FlatIndex.h"
 #include "platform/SharedString.h"
 
 namespace tessel {
@@ -21,11 +22,11 @@ struct PairLimits {
 
 class PairLimit {
  public:
-  explicit PairLimit(PairLimits limits = {});
+  explicit PairLimit(PairLimits limits = {}) : limits_(limits) {}
 
   // Whether the pair is among those let in; lets it in where there is room. Counts a refusal.
   bool admits(StringRef subsystem, StringRef category);
-  size_t pairs() const { return count_; }
+  size_t pairs() const { return pairs_.size(); }
   uint64_t refusals() const { return refusals_; }
 
  private:
@@ -36,11 +37,9 @@ class PairLimit {
     bool operator==(const Pair&) const = default;
   };
 
-  Pair& slotOf(const Pair& pair);
-
   const PairLimits limits_;
-  std::vector<Pair> slots_;  // open addressing, at most half full; all zero is an empty slot
-  size_t count_ = 0;
+  std::vector<Pair> pairs_;  // those that were let in
+  FlatIndex index_;          // of pairs_
   size_t textBytes_ = 0;
   uint64_t refusals_ = 0;
 };

@@ -13,12 +13,6 @@ namespace {
 // Fields that one entry may add after the limits were looked at.
 constexpr size_t kRoomForOneEntry = 4096;
 
-uint64_t hashOf(uint64_t bits, FieldKind kind) {
-  uint64_t hash = (bits + static_cast<uint64_t>(kind)) * 0x9e3779b97f4a7c15u;
-  hash ^= hash >> 32;
-  return hash * 0xd1b54a32d192ed03u;
-}
-
 // A field that the daemon adds; what is wrong with one is no fault of the trace point.
 bool isDaemonField(FieldKind kind) {
   return kind == FieldKind::imagePath || kind == FieldKind::processName ||
@@ -35,7 +29,6 @@ TracePointTable::Contents TracePointTable::emptyContents(const TracePointTableLi
   // Room for all at once: pages that are never touched cost nothing, and nothing is ever moved.
   contents.fields.reserve(limits.fields + kRoomForOneEntry);
   contents.fields.emplace_back();
-  contents.index.resize(64);
   return contents;
 }
 
@@ -172,28 +165,11 @@ FieldToken TracePointTable::add(const Field& field) {
 }
 
 FieldToken TracePointTable::addOnce(const Field& field) {
-  if (contents_.indexed * 2 >= contents_.index.size()) growIndex();
-  const size_t mask = contents_.index.size() - 1;
-  for (size_t slot = hashOf(field.identity(), field.kind) & mask;; slot = (slot + 1) & mask) {
-    FieldToken& token = contents_.index[slot];
-    if (token == kNoToken) {
-      ++contents_.indexed;
-      return token = add(field);
-    }
-    if (kind(token) == field.kind && at(token).identity() == field.identity()) return token;
-  }
-}
-
-void TracePointTable::growIndex() {
-  std::vector<FieldToken> old(contents_.index.size() * 2);
-  old.swap(contents_.index);
-  const size_t mask = contents_.index.size() - 1;
-  for (const FieldToken token : old) {
-    if (token == kNoToken) continue;
-    size_t slot = hashOf(at(token).identity(), kind(token)) & mask;
-    while (contents_.index[slot] != kNoToken) slot = (slot + 1) & mask;
-    contents_.index[slot] = token;
-  }
+  const uint32_t hash = hashWords(field.identity(), static_cast<uint64_t>(field.kind));
+  const auto isField = [&](FieldToken token) {
+    return kind(token) == field.kind && at(token).identity() == field.identity();
+  };
+  return contents_.index.findOrAdd(hash, isField, [&] { return add(field); });
 }
 
 FieldToken TracePointTable::bootToken(const Id128& boot) {

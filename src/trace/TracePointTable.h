@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
+#include "platform/FlatIndex.h"
 #include "platform/Number.h"
 #include "platform/SharedString.h"
 #include "trace/TracePointFields.h"
@@ -102,8 +103,7 @@ class TracePointTable final : public FieldTokenizer {
     std::shared_ptr<StringPool> strings = std::make_shared<StringPool>();
     std::vector<Field> fields;
     std::vector<std::pair<StringRef, StringRef>> attributes;
-    std::vector<FieldToken> index;  // open addressing over fields that are found again by value
-    size_t indexed = 0;
+    FlatIndex index;  // of the tokens of fields that are found again by value
   };
 
   // Beside the reason in the value of what is malformed.
@@ -125,7 +125,6 @@ class TracePointTable final : public FieldTokenizer {
   FieldToken textToken(FieldKind kind, std::string_view value);
   FieldToken add(const Field& field);
   FieldToken addOnce(const Field& field);
-  void growIndex();
   bool holds(size_t share) const;
   FieldToken addAgain(const Field& old);
 

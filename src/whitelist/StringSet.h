@@ -5,12 +5,13 @@
 
 #pragma once
 
-#include <cstdint>
+#include <cstddef>
 #include <initializer_list>
 #include <span>
 #include <string_view>
 #include <vector>
 
+#include "platform/FlatIndex.h"
 #include "platform/SharedString.h"
 
 namespace tessel {
@@ -24,17 +25,13 @@ class StringSet {
 
   // Exact, case-sensitive membership; an absent string is a member of no set.
   bool contains(StringRef value) const;
-  size_t size() const { return size_; }
+  size_t size() const { return texts_.size(); }
 
  private:
   void add(std::string_view text);
-  size_t slotOf(std::string_view text, uint64_t hash) const;
 
-  // Open addressing; a power of two, at most half of it taken. Most values that are asked about are
-  // members of no set: what tells that is kept together, apart from the texts.
-  std::vector<uint32_t> marks_;  // of the hash; 0: the slot is free
   std::vector<std::string_view> texts_;
-  size_t size_ = 0;
+  FlatIndex index_;  // of texts_
 };
 
 }  // namespace tessel

@@ -1,7 +1,8 @@
 // KeyedCounts: counts by a few strings that are taken together.
 //
-// A key is looked for as its strings are borrowed, by addresses and hashes, and takes a share of
-// them once, when it is new. Absent strings are told apart from empty ones.
+// A search borrows the strings of its key and copies nothing. Only a key that is new takes a share
+// of its strings, so that they outlive the object they came with. An absent string is another key
+// than an empty one.
 //
 // Threads: one at a time.
 
@@ -11,8 +12,10 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <utility>
 #include <vector>
 
+#include "platform/FlatIndex.h"
 #include "platform/SharedString.h"
 
 namespace tessel::ctl {
@@ -32,30 +35,23 @@ class KeyedCounts {
 
   // The count of the key; null where it has none. Valid until the next add().
   Count* find(const Key& key) {
-    const size_t at = slotOf(key, hashOf(key));
-    return slots_[at].number == 0 ? nullptr : &entries_[slots_[at].number - 1].count;
+    const uint32_t number =
+        index_.find(hashOf(key), [&](uint32_t other) { return matches(entries_[other], key); });
+    return number == FlatIndex::kNone ? nullptr : &entries_[number].count;
   }
   // The new count of a key. REQUIRES: it has none.
   Count& add(const Key& key) {
-    if (entries_.size() * 2 >= slots_.size()) grow();
+    index_.add(hashOf(key), static_cast<uint32_t>(entries_.size()));
     Entry entry{{}, key.slot, {}};
     std::copy(key.texts.begin(), key.texts.end(), entry.texts.begin());
     entries_.push_back(std::move(entry));
-    const uint32_t hash = hashOf(key);
-    slots_[slotOf(key, hash)] = {hash, static_cast<uint32_t>(entries_.size())};
     return entries_.back().count;
   }
   // In the order in which they were added.
   const std::vector<Entry>& entries() const { return entries_; }
 
  private:
-  // Open addressing. The hash stands beside the number, so that a search for a key that has no
-  // count looks at nothing else.
-  struct Slot {
-    uint32_t hash = 0;
-    uint32_t number = 0;  // of the entry, from 1 on; 0: the slot is free
-  };
-
+  // The hashes of the texts are seeded, so a sum of them needs no seed of its own.
   static uint32_t hashOf(const Key& key) {
     uint64_t hash = key.slot;
     for (const StringRef text : key.texts) hash = hash * 0x9e3779b97f4a7c15u + text.hash();
@@ -69,29 +65,8 @@ class KeyedCounts {
     }
     return entry.slot == key.slot;
   }
-  // The slot of the key, or the free one where it would stand.
-  size_t slotOf(const Key& key, uint32_t hash) const {
-    const size_t mask = slots_.size() - 1;
-    for (size_t at = hash & mask;; at = (at + 1) & mask) {
-      const Slot& slot = slots_[at];
-      if (slot.number == 0 || (slot.hash == hash && matches(entries_[slot.number - 1], key)))
-        return at;
-    }
-  }
-  void grow() {
-    std::vector<Slot> old(slots_.size() * 2);
-    old.swap(slots_);
-    const size_t mask = slots_.size() - 1;
-    for (const Slot& slot : old) {
-      if (slot.number == 0) continue;
-      size_t at = slot.hash & mask;
-      while (slots_[at].number != 0) at = (at + 1) & mask;
-      slots_[at] = slot;
-    }
-  }
-
   std::vector<Entry> entries_;
-  std::vector<Slot> slots_ = std::vector<Slot>(64);
+  FlatIndex index_;  // of entries_
 };
 
 }  // namespace tessel::ctl
