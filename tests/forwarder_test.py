@@ -200,7 +200,7 @@ class Trouble(ForwarderTest):
             self.assertEqual(self.run_forwarder(receiver).returncode, 0)
         self.assertEqual(len(receiver.requests), 1)
         self.assertEqual(self.counters()["rejected"], 2)
-        self.assertIn("too old", self.errors)
+        self.assertEqual(self.errors, "statora_forwarder: error: The collector rejected 2 records: too old\n")
         self.assert_all_arrived_once(receiver, 5)
 
     def test_one_bad_record_is_set_aside_with_the_collectors_words(self):

@@ -121,8 +121,8 @@ class Texts(unittest.TestCase):
         self.assertEqual((result.returncode, result.stdout + result.stderr), (0, ""))
 
     def test_every_message_with_an_id_is_in_the_catalog(self):
-        with open(os.path.join(ROOT, "src", "linux", "LogSinks.h"), encoding="utf-8") as header:
-            ids = re.findall(r'"([0-9a-f]{32})"', header.read())
+        with open(os.path.join(ROOT, "src", "linux", "LogSinks.cpp"), encoding="utf-8") as source:
+            ids = re.findall(r'"([0-9a-f]{32})"', source.read())
         with open(os.path.join(SYSTEMD, "tessel.catalog"), encoding="utf-8") as catalog:
             text = catalog.read()
         self.assertEqual(sorted(ids), sorted(re.findall(r"(?m)^-- ([0-9a-f]{32})$", text)))

@@ -5,8 +5,6 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/Log.h"
-
 namespace tessel {
 
 namespace {
@@ -93,7 +91,7 @@ Forwarder::Sent Forwarder::send(Records part) {
 
 bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
   const std::string words = answerWords(answer);
-  if (failures == 1) tesselReporterLog().error("The collector takes nothing for now: %@", words);
+  if (failures == 1) kForwarderLog.error("The collector takes nothing for now: %@", words);
   world_.status.say("Waiting for the collector: " + words);
   ++world_.state.counters().retries;
   world_.state.storeCounters();
@@ -111,8 +109,8 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
   const PartialSuccess partial = partialSuccess(answer.body);
   if (partial.rejected > 0) {
     world_.state.counters().rejected += partial.rejected;
-    tesselReporterLog().error("The collector rejected %llu records: %@", partial.rejected,
-                              partial.message);
+    kForwarderLog.error("The collector rejected %llu records: %@", partial.rejected,
+                        partial.message);
   }
   std::vector<int64_t> ids;
   for (const OutgoingRecord& record : part) ids.push_back(record.event.id);
@@ -126,7 +124,7 @@ bool Forwarder::setAside(const SpooledEvent& event, int64_t status, const std::s
     fail(ForwarderOutcome::spoolFailed, stored.reason);
     return false;
   }
-  tesselReporterLog().error("Event %@ is set aside: %@", std::to_string(event.id), words);
+  kForwarderLog.error("Event %@ is set aside: %@", std::to_string(event.id), words);
   return true;
 }
 

@@ -19,12 +19,16 @@
 #include "forwarder/Collector.h"
 #include "forwarder/OtlpBody.h"
 #include "forwarder/Policy.h"
+#include "platform/Log.h"
 #include "platform/Queues.h"
 #include "platform/Service.h"
 #include "platform/System.h"
 #include "statora/ForwarderState.h"
 
 namespace tessel {
+
+// The log of this program. Its category is the program's name, by which `journalctl -t` finds it.
+inline constexpr LogHandle kForwarderLog("com.vantor.TesselSupport", "statora_forwarder");
 
 struct ForwarderOptions {
   size_t maxRecords = 512;            // in a batch

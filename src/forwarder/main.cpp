@@ -100,7 +100,7 @@ int exitStatus(ForwarderOutcome outcome) {
 class Complaints {
  public:
   void tell(const std::string& words) {
-    if (words != last_ && !words.empty()) tesselReporterLog().error("%@", words);
+    if (words != last_ && !words.empty()) kForwarderLog.error("%@", words);
     last_ = words;
   }
 
@@ -212,7 +212,8 @@ int run(const Arguments& arguments) {
   const auto launch = readLaunchConfiguration(environment);
   if (const auto* error = std::get_if<LaunchError>(&launch)) return complain(*error);
   const auto& configuration = std::get<LaunchConfiguration>(launch);
-  static LogSink* const sink = makeLogSink(configuration.logDestination).release();
+  static LogSink* const sink =
+      makeLogSink(configuration.logDestination, "statora_forwarder").release();
   setLogSink(sink, configuration.logLevel);
   if (arguments.requeue) return requeue(configuration.stateDirectory);
   if (arguments.dryRun)

@@ -1,6 +1,11 @@
 // The journal and standard error as log sinks.
+//
+// A log line must arrive whatever else fails, so neither sink keeps a file, a lock or a buffer. A
+// message that the journal refuses (the daemon is not there, or its disk is full) goes to standard
+// error, which the service manager keeps as well. What that refuses too is lost without a further
+// attempt: a run is worth more than its log.
 
-#define SD_JOURNAL_SUPPRESS_LOCATION  // the place of the call says nothing: all lines pass here
+#define SD_JOURNAL_SUPPRESS_LOCATION  // every line is sent from this file
 
 #include "linux/LogSinks.h"
 
@@ -13,12 +18,35 @@
 
 namespace tessel {
 
+namespace {
+
+// The lines that packaging/systemd/tessel.catalog explains, by their beginnings. An entry carries
+// the identifier, and `journalctl -x` then shows the explanation. A test of the packages holds this
+// table against the catalog.
+constexpr struct {
+  std::string_view beginning;
+  std::string_view id;  // 32 hexadecimal digits
+} kCatalogedMessages[] = {
+    {"Bailing due to cookie file", "88bc816f3d5048b0ace67b9e33914435"},
+    {"Could not clear cookie file: ", "9cb66619cda440b487900bffc379e114"},
+    {"Failed to process tessel data due to error: ", "a945202e0c6242889cfdf3bf6a9058b7"},
+    {"Not reporting ", "aab21dd8ab154e9e9b6bcf90786745c9"},
+    {"Trying to stop in-flight reporting work.", "028e77c9a30243d590fb466bdd747234"},
+    {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
+};
+
+}  // namespace
+
+StderrLog::StderrLog(std::string_view program, int fd)
+    : lineStart_(program.empty() ? "" : std::string(program) + ": "), fd_(fd) {}
+
 void StderrLog::write(LogLevel level, std::string_view /*subsystem*/, std::string_view /*category*/,
                       std::string_view text) {
   if (text.ends_with('\n')) text.remove_suffix(1);
-  std::string line = level == LogLevel::error ? "error: " : "debug: ";
+  std::string line = lineStart_ + (level == LogLevel::error ? "error: " : "debug: ");
   line += plainText(text, "\n    ");
   line += '\n';
+  // One write for the whole line, so that the lines of several threads do not mix.
   writeAll(fd_, line);
 }
 
@@ -29,8 +57,12 @@ std::vector<std::string> journalFields(LogLevel level, std::string_view subsyste
   std::vector<std::string> fields{
       "MESSAGE=" + std::string(text), "PRIORITY=" + std::string(priority),
       "LOG_SUBSYSTEM=" + std::string(subsystem), "LOG_CATEGORY=" + std::string(category),
-      "SYSLOG_IDENTIFIER=tessel_reporter"};
-  if (const auto id = messageIdOf(text)) fields.push_back("MESSAGE_ID=" + std::string(*id));
+      "SYSLOG_IDENTIFIER=" + std::string(category)};
+  for (const auto& message : kCatalogedMessages) {
+    if (!text.starts_with(message.beginning)) continue;
+    fields.push_back("MESSAGE_ID=" + std::string(message.id));
+    break;
+  }
   return fields;
 }
 
@@ -40,20 +72,21 @@ void JournalLog::write(LogLevel level, std::string_view subsystem, std::string_v
   std::vector<iovec> parts;
   parts.reserve(fields.size());
   for (std::string& field : fields) parts.push_back({field.data(), field.size()});
+  // A field is sent with its length, so a text with line feeds stays one entry.
   if (sd_journal_sendv(parts.data(), static_cast<int>(parts.size())) < 0) {
     fallback_.write(level, subsystem, category, text);
   }
 }
 
 std::unique_ptr<LogSink> makeLogSink(std::optional<LogDestination> destination,
-                                     const std::string& journalSocket) {
+                                     std::string_view program, const std::string& journalSocket) {
   struct stat facts {};
   const bool hasJournal = ::stat(journalSocket.c_str(), &facts) == 0 && S_ISSOCK(facts.st_mode);
   const LogDestination automatic =
       hasJournal ? LogDestination::journal : LogDestination::standardError;
   if (destination.value_or(automatic) == LogDestination::journal)
-    return std::make_unique<JournalLog>();
-  return std::make_unique<StderrLog>();
+    return std::make_unique<JournalLog>(program);
+  return std::make_unique<StderrLog>(program);
 }
 
 }  // namespace tessel

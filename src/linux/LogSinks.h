@@ -1,11 +1,10 @@
-// Where log lines go: the journal, or a terminal's lines on standard error.
+// Where log lines go: the journal, or standard error.
 //
-// Both sinks may be used from any thread and keep no state, so they are made once and never
-// destroyed.
+// Both sinks may be used from any thread and keep no state that changes. They are made once and
+// never destroyed, because a detached thread may log until the very end of the process.
 
 #pragma once
 
-#include <array>
 #include <memory>
 #include <optional>
 #include <string>
@@ -17,28 +16,26 @@
 
 namespace tessel {
 
-// Where log lines go: the journal, or a terminal's lines on standard error.
-//
-// Both sinks may be used from any thread and keep no state, so they are made once and never
-// destroyed.
-
-// One line per message: "error: text" or "debug: text". One line feed at the end of the text is the
-// line's own; further lines of a text are indented, and control characters are written as \xNN.
+// Writes one line per message: "error: text" or "debug: text". A line feed that ends the text ends
+// the line. The text's further lines are indented and its control characters become \xNN, so that
+// text from outside can neither start a line of its own nor command a terminal.
 class StderrLog final : public LogSink {
  public:
-  // Writes to `fd`, which is not owned.
-  explicit StderrLog(int fd = 2) : fd_(fd) {}
+  // `program` and ": " stand before each line, unless it is empty. `fd` is not owned.
+  explicit StderrLog(std::string_view program = {}, int fd = 2);
   void write(LogLevel level, std::string_view subsystem, std::string_view category,
              std::string_view text) override;
 
  private:
+  const std::string lineStart_;
   const int fd_;
 };
 
-// One journal entry per message, its text as it stands. What the journal does not take goes to
-// standard error.
+// Writes one journal entry per message and leaves the text as it is. A message that the journal
+// does not take goes to standard error.
 class JournalLog final : public LogSink {
  public:
+  explicit JournalLog(std::string_view program = {}) : fallback_(program) {}
   void write(LogLevel level, std::string_view subsystem, std::string_view category,
              std::string_view text) override;
 
@@ -46,38 +43,15 @@ class JournalLog final : public LogSink {
   StderrLog fallback_;
 };
 
-// The fields of one message's journal entry, each NAME=value. None is a trace-point field.
+// The fields of one message's journal entry, each NAME=value. The category is the identifier that
+// `journalctl -t` looks for. No field is one of a trace point, so a log line is never read as one.
 std::vector<std::string> journalFields(LogLevel level, std::string_view subsystem,
                                        std::string_view category, std::string_view text);
 
-// The sink for `destination`; without one, the journal where its socket exists, else standard
-// error.
+// Makes the sink for `destination`. If that is absent, the sink is the journal if its socket
+// exists, and standard error otherwise. See StderrLog for `program`.
 std::unique_ptr<LogSink> makeLogSink(
-    std::optional<LogDestination> destination,
+    std::optional<LogDestination> destination, std::string_view program = {},
     const std::string& journalSocket = "/run/systemd/journal/socket");
-
-// Which log lines the journal can explain: their identifiers in the message catalog.
-
-struct CatalogedMessage {
-  std::string_view beginning;  // of the line; the first that fits decides
-  std::string_view id;         // 32 hexadecimal digits
-};
-
-// packaging/systemd/tessel.catalog has an entry for each.
-inline constexpr std::array<CatalogedMessage, 6> kCatalogedMessages{{
-    {"Bailing due to cookie file", "88bc816f3d5048b0ace67b9e33914435"},
-    {"Could not clear cookie file: ", "9cb66619cda440b487900bffc379e114"},
-    {"Failed to process tessel data due to error: ", "a945202e0c6242889cfdf3bf6a9058b7"},
-    {"Not reporting ", "aab21dd8ab154e9e9b6bcf90786745c9"},
-    {"Trying to stop in-flight reporting work.", "028e77c9a30243d590fb466bdd747234"},
-    {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
-}};
-
-constexpr std::optional<std::string_view> messageIdOf(std::string_view text) {
-  for (const CatalogedMessage& message : kCatalogedMessages) {
-    if (text.starts_with(message.beginning)) return message.id;
-  }
-  return std::nullopt;
-}
 
 }  // namespace tessel

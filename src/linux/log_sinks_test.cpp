@@ -17,10 +17,10 @@ namespace {
 
 using testing::TemporaryDirectory;
 
-std::string linesOf(LogLevel level, std::string_view text) {
+std::string linesOf(LogLevel level, std::string_view text, std::string_view program = {}) {
   const TemporaryDirectory directory;
   const UniqueFd file(::open(directory.path("log").c_str(), O_WRONLY | O_CREAT, 0600));
-  StderrLog(file.get()).write(level, "com.vantor.TesselSupport", "tessel_reporter", text);
+  StderrLog(program, file.get()).write(level, "com.vantor.TesselSupport", "category", text);
   return directory.read("log");
 }
 
@@ -42,6 +42,7 @@ TEST(StderrLogTest, EachMessageIsOneLineAndTextOfStrangersStartsNoneAndReachesNo
   };
   for (const auto& [text, line] : kCases) EXPECT_EQ(linesOf(LogLevel::debug, text), line);
   EXPECT_EQ(linesOf(LogLevel::error, "Could not"), "error: Could not\n");
+  EXPECT_EQ(linesOf(LogLevel::error, "a\nb", "program"), "program: error: a\n    b\n");
 }
 
 TEST(JournalLogTest, AnEntryKeepsTheTextAndCannotLookLikeATracePoint) {
@@ -51,7 +52,8 @@ TEST(JournalLogTest, AnEntryKeepsTheTextAndCannotLookLikeATracePoint) {
                           "MESSAGE=Checking in\nTESSEL_KIND=event\n", "PRIORITY=7",
                           "LOG_SUBSYSTEM=com.vantor.TesselSupport", "LOG_CATEGORY=tessel_reporter",
                           "SYSLOG_IDENTIFIER=tessel_reporter"));
-  EXPECT_THAT(journalFields(LogLevel::error, "", "", ""), ::testing::Contains("PRIORITY=3"));
+  EXPECT_THAT(journalFields(LogLevel::error, "", "statora_forwarder", ""),
+              ::testing::IsSupersetOf({"PRIORITY=3", "SYSLOG_IDENTIFIER=statora_forwarder"}));
   EXPECT_THAT(journalFields(LogLevel::debug, "", "", "Bailing due to cookie file"),
               ::testing::Contains("MESSAGE_ID=88bc816f3d5048b0ace67b9e33914435"));
 }
@@ -63,8 +65,8 @@ bool isJournal(const std::unique_ptr<LogSink>& sink) {
 TEST(MakeLogSinkTest, TheJournalIsUsedWhereItsSocketIs) {
   const TemporaryDirectory directory;
   const std::string path = directory.path("socket");
-  EXPECT_FALSE(isJournal(makeLogSink({}, path)));
-  EXPECT_FALSE(isJournal(makeLogSink({}, directory.write("file", ""))));
+  EXPECT_FALSE(isJournal(makeLogSink({}, "", path)));
+  EXPECT_FALSE(isJournal(makeLogSink({}, "", directory.write("file", ""))));
 
   const UniqueFd socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   sockaddr_un address{};
@@ -72,9 +74,9 @@ TEST(MakeLogSinkTest, TheJournalIsUsedWhereItsSocketIs) {
   ASSERT_LT(path.size(), sizeof address.sun_path);
   std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
   ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-  EXPECT_TRUE(isJournal(makeLogSink({}, path)));
-  EXPECT_FALSE(isJournal(makeLogSink(LogDestination::standardError, path)));
-  EXPECT_TRUE(isJournal(makeLogSink(LogDestination::journal, directory.path("none"))));
+  EXPECT_TRUE(isJournal(makeLogSink({}, "", path)));
+  EXPECT_FALSE(isJournal(makeLogSink(LogDestination::standardError, "", path)));
+  EXPECT_TRUE(isJournal(makeLogSink(LogDestination::journal, "", directory.path("none"))));
 }
 
 }  // namespace
