@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "filter/DefaultDownsampling.h"
+#include "platform/Invariant.h"
 #include "whitelist/StringWhitelist.h"
 
 namespace tessel {
@@ -16,6 +17,17 @@ namespace {
 
 const TesselObject* asTesselObject(const TesselSupportObject& object) {
   return object.isKindOf(TesselClass::object) ? static_cast<const TesselObject*>(&object) : nullptr;
+}
+
+// Whether exactly the fields of the classification's own rule are set.
+bool isConsistent(const FilterDecision& decision) {
+  const auto code = decision.classification;
+  return (decision.stringSlot != 0) ==
+             (code == TesselReporterClassificationFailedStringWhitelist) &&
+         (decision.durationSeconds < 0.0F) ==
+             (code == TesselReporterClassificationDurationThreshold) &&
+         (decision.downsampleEntry != nullptr ||
+          code != TesselReporterClassificationFailedSCFilter);
 }
 
 // Counts slots from 0; the decision names them from 1, as their accessors do.
@@ -60,6 +72,8 @@ bool TesselReporterObjectFilter::shouldReportTesselObject(
 
 FilterDecision TesselReporterObjectFilter::inspectTesselObject(const TesselSupportObject& object) {
   const FilterDecision decision = decide(object);
+  // Whoever is shown the reason is shown these fields, so they must name what decided.
+  TESSEL_INVARIANT(isConsistent(decision));
   incrementTotalForObject(object, decision.classification);
   return decision;
 }
@@ -117,8 +131,8 @@ void TesselReporterObjectFilter::incrementTotalForObject(
   const StringRef category = point ? point->category() : StringRef();
 
   allInspected_.incrementSubsystem(subsystem, category);
-  if (Aggregation* aggregation = aggregationFor(classification))
-    aggregation->incrementSubsystem(subsystem, category);
+  if (classification < classified_.size())
+    classified_[classification].incrementSubsystem(subsystem, category);
 
   const bool reported = classification == TesselReporterClassificationTelemetryReported;
   if (object.isKindOf(TesselClass::animationInterval)) {
@@ -131,23 +145,10 @@ void TesselReporterObjectFilter::incrementTotalForObject(
   }
 }
 
-TesselReporterAggregation* TesselReporterObjectFilter::aggregationFor(
-    TesselReporterClassification classification) {
-  switch (classification) {
-    case TesselReporterClassificationTelemetryDisabled:
-      return &disabled_;
-    case TesselReporterClassificationTelemetryReported:
-      return &reported_;
-    case TesselReporterClassificationFailedStringWhitelist:
-      return &failedStringWhitelist_;
-    case TesselReporterClassificationDurationThreshold:
-      return &durationThreshold_;
-    case TesselReporterClassificationFailedSCFilter:
-      return &failedSCFilter_;
-    case TesselReporterClassificationClassNotSupported:
-      return &classNotSupported_;
-  }
-  return nullptr;
+ClassifiedCounts TesselReporterObjectFilter::classifiedCounts() const {
+  ClassifiedCounts counts{};
+  for (size_t code = 0; code < counts.size(); ++code) counts[code] = classified_[code].totalCount();
+  return counts;
 }
 
 }  // namespace tessel

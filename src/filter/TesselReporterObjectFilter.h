@@ -10,26 +10,18 @@
 
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <memory>
 
 #include "filter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter.h"
 #include "filter/TesselReporterAggregation.h"
 #include "objects/TesselObject.h"
+#include "objects/TesselReporterClassification.h"
 #include "objects/TesselReporterPlatform.h"
 #include "platform/System.h"
 
 namespace tessel {
-
-// Why an object is or is not reported: the first check that it failed, in the order 5, 0, 3, 2, 4.
-enum TesselReporterClassification : uint64_t {
-  TesselReporterClassificationTelemetryDisabled = 0,
-  TesselReporterClassificationTelemetryReported = 1,
-  TesselReporterClassificationFailedStringWhitelist = 2,
-  TesselReporterClassificationDurationThreshold = 3,
-  TesselReporterClassificationFailedSCFilter = 4,
-  TesselReporterClassificationClassNotSupported = 5,
-};
 
 // What the filter decided about one object, and what decided. Its strings are the object's; the
 // entry is the downsampling filter's and shows the counters as they are when it is read, so before
@@ -86,20 +78,30 @@ class TesselReporterObjectFilter {
 
   const Aggregation& allInspectedTesselObjectsAggregation() const { return allInspected_; }
   const Aggregation& telemetryReportedEventsAggregation() const { return reportedEvents_; }
-  const Aggregation& telemetryReportedAggregation() const { return reported_; }
-  const Aggregation& telemetryDisabledAggregation() const { return disabled_; }
+  // The objects of one classification. REQUIRES: the code is in the table of classifications.
+  const Aggregation& aggregationFor(TesselReporterClassification classification) const {
+    return classified_[classification];
+  }
+  const Aggregation& telemetryReportedAggregation() const {
+    return aggregationFor(TesselReporterClassificationTelemetryReported);
+  }
+  const Aggregation& telemetryDisabledAggregation() const {
+    return aggregationFor(TesselReporterClassificationTelemetryDisabled);
+  }
   const Aggregation& telemetryNotReportedFailedStringWhitelistAggregation() const {
-    return failedStringWhitelist_;
+    return aggregationFor(TesselReporterClassificationFailedStringWhitelist);
   }
   const Aggregation& telemetryNotReportedFailedSCFilterAggregation() const {
-    return failedSCFilter_;
+    return aggregationFor(TesselReporterClassificationFailedSCFilter);
   }
   const Aggregation& telemetryNotReportedDurationThresholdAggregation() const {
-    return durationThreshold_;
+    return aggregationFor(TesselReporterClassificationDurationThreshold);
   }
   const Aggregation& telemetryNotReportedClassNotSupportedAggregation() const {
-    return classNotSupported_;
+    return aggregationFor(TesselReporterClassificationClassNotSupported);
   }
+  // The total of each classification.
+  ClassifiedCounts classifiedCounts() const;
 
   // Per kind; an animation interval counts as an animation only.
   uint64_t totalUnreportedIntervalCount() const { return intervals_.unreported; }
@@ -120,20 +122,13 @@ class TesselReporterObjectFilter {
   FilterDecision decide(const TesselSupportObject& object) const;
   bool objectPassesStringFilter(const TesselObject& object, FilterDecision& decision) const;
   bool objectPassesDownsampling(const TesselObject& object, FilterDecision& decision) const;
-  // The aggregation of one classification; null for a code outside the enumeration.
-  Aggregation* aggregationFor(TesselReporterClassification classification);
 
   const TesselReporterPlatform platform_;
   BuildVariant& variant_;
   std::shared_ptr<TRSubsystemCategoryNameFilter> scnFilter_;
   Aggregation allInspected_;
   Aggregation reportedEvents_;
-  Aggregation reported_;
-  Aggregation disabled_;
-  Aggregation failedStringWhitelist_;
-  Aggregation failedSCFilter_;
-  Aggregation durationThreshold_;
-  Aggregation classNotSupported_;
+  std::array<Aggregation, kClassifications.size()> classified_;  // by code
   KindTotal intervals_;
   KindTotal animations_;
   KindTotal events_;

@@ -218,16 +218,6 @@ TEST_F(ObjectFilterTest, ACodeOutsideTheEnumerationIsInspectedAndNotReported) {
   EXPECT_EQ(filter->telemetryReportedAggregation().totalCount(), 0u);
 }
 
-std::vector<const TesselReporterAggregation*> perClassification(
-    const TesselReporterObjectFilter& filter) {
-  return {&filter.telemetryDisabledAggregation(),
-          &filter.telemetryReportedAggregation(),
-          &filter.telemetryNotReportedFailedStringWhitelistAggregation(),
-          &filter.telemetryNotReportedDurationThresholdAggregation(),
-          &filter.telemetryNotReportedFailedSCFilterAggregation(),
-          &filter.telemetryNotReportedClassNotSupportedAggregation()};
-}
-
 // An object of one of the kinds, right or wrong in one way or several.
 TestPoint anyPoint(std::mt19937& random) {
   const auto chance = [&random](unsigned in) { return random() % in == 0; };
@@ -246,7 +236,7 @@ TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderItsReasonAndItsKind) {
   const std::function<std::shared_ptr<const TesselObject>(const TestPoint&)> makers[] = {
       makeEvent, makeInterval, makeAnimationInterval, makeObject};
   std::mt19937 random(20261122);
-  uint64_t expected[6] = {};
+  ClassifiedCounts expected{};
   uint64_t ofKind[4][2] = {};
   constexpr uint64_t kCalls = 5000;
   for (uint64_t i = 0; i < kCalls; ++i) {
@@ -255,13 +245,13 @@ TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderItsReasonAndItsKind) {
     ++expected[decision.classification];
     ++ofKind[kind][decision.shouldReport()];
   }
-  const auto aggregations = perClassification(*filter);
-  for (size_t code = 0; code < aggregations.size(); ++code) {
-    EXPECT_EQ(aggregations[code]->totalCount(), expected[code]) << code;
-    EXPECT_GT(expected[code], 0u) << code;
+  EXPECT_EQ(filter->classifiedCounts(), expected);
+  for (const auto& [code, name, title] : kClassifications) {
+    EXPECT_GT(expected[code], 0u) << name;
     uint64_t sum = 0;
-    for (const auto& entry : aggregations[code]->aggregationDictionary()) sum += entry.count;
-    EXPECT_EQ(sum, expected[code]);
+    for (const auto& entry : filter->aggregationFor(code).aggregationDictionary())
+      sum += entry.count;
+    EXPECT_EQ(sum, expected[code]) << name;
   }
   EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), kCalls);
   EXPECT_EQ(filter->telemetryReportedEventsAggregation().totalCount(), ofKind[0][true]);

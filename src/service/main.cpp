@@ -59,12 +59,7 @@ RunOutcome outcomeOf(const RunReport& report) {
 
 void addObjects(RunRecord& record, const TesselReporterObjectFilter& filter) {
   record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
-  record.classified = {filter.telemetryDisabledAggregation().totalCount(),
-                       filter.telemetryReportedAggregation().totalCount(),
-                       filter.telemetryNotReportedFailedStringWhitelistAggregation().totalCount(),
-                       filter.telemetryNotReportedDurationThresholdAggregation().totalCount(),
-                       filter.telemetryNotReportedFailedSCFilterAggregation().totalCount(),
-                       filter.telemetryNotReportedClassNotSupportedAggregation().totalCount()};
+  record.classified = filter.classifiedCounts();
 }
 
 void addRows(RunRecord& record, const SpoolFigures& figures) {

@@ -112,6 +112,7 @@ std::string explanationJson(const Explanation& explanation) {
 constexpr size_t kNameWidth = 60;     // columns of a subsystem, category or name
 constexpr size_t kVerdictWidth = 18;  // of the longest verdict
 constexpr size_t kKindWidth = 9;
+constexpr size_t kFooterWidth = 94;  // as wide as the help text around it
 
 std::string padded(std::string text, size_t width) {
   text.resize(std::max(width, text.size()), ' ');
@@ -270,18 +271,24 @@ int runExplain(const ExplainOptions& options) {
   return ExplainRun(options, *reading).explain();
 }
 
-constexpr char kExplainFooter[] =
-    "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at zero, "
-    "as\n"
-    "in a service that has just started. Without a period the last 24 hours are read, as in a "
-    "run.\n"
-    "Patterns may hold * and ?. Members of the group systemd-journal may read the journal.\n\n"
-    "Verdicts: reported, telemetry_disabled, string_whitelist, duration, downsampled,\n"
-    "class_not_supported.\n\n"
-    "Examples:\n"
-    "  tesselctl explain --last 1h --subsystem 'com.vantor.*' --verdict string_whitelist\n"
-    "  tesselctl explain --follow\n"
-    "  tesselctl explain --summary";
+std::string explainFooter() {
+  std::string verdicts;
+  for (const ClassificationRow& row : kClassifications)
+    verdicts += (verdicts.empty() ? "Verdicts: " : ", ") + std::string(row.name);
+  return "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at "
+         "zero, "
+         "as\n"
+         "in a service that has just started. Without a period the last 24 hours are read, as in a "
+         "run.\n"
+         "Patterns may hold * and ?. Members of the group systemd-journal may read the "
+         "journal.\n\n" +
+         wrapped(verdicts + ".", kFooterWidth, 0) +
+         "\n\n"
+         "Examples:\n"
+         "  tesselctl explain --last 1h --subsystem 'com.vantor.*' --verdict string_whitelist\n"
+         "  tesselctl explain --follow\n"
+         "  tesselctl explain --summary";
+}
 
 void addFilterOptions(CLI::App& command, ExplainOptions& options) {
   const auto filter = [&](const char* name, std::vector<std::string>& values, const char* help) {
@@ -293,7 +300,8 @@ void addFilterOptions(CLI::App& command, ExplainOptions& options) {
   filter("--verdict", options.verdicts, "Only with this verdict; may be repeated")
       ->type_name("VERDICT")
       ->check([](const std::string& name) {
-        return verdictNamed(name) ? std::string() : "'" + terminalText(name) + "' is no verdict";
+        const bool known = std::ranges::count(kClassifications, name, &ClassificationRow::name);
+        return known ? "" : "'" + terminalText(name) + "' is no verdict";
       });
 }
 
@@ -310,7 +318,7 @@ void addExplainCommand(CLI::App& app, Invocation& invocation) {
   command->add_flag("--summary", options->summary, "Show figures instead of trace points");
   command->add_flag("--follow", options->follow, "Go on with what is recorded from now on");
   command->add_flag("--json", options->json, "One JSON object a line; with --summary one object");
-  command->footer(kExplainFooter);
+  command->footer(explainFooter());
   command->callback([&invocation, options] { invocation.status = runExplain(*options); });
 }
 

@@ -8,26 +8,6 @@
 
 namespace tessel::ctl {
 
-namespace {
-
-// By classification code.
-constexpr std::string_view kNames[kVerdicts] = {"telemetry_disabled", "reported",
-                                                "string_whitelist",   "duration",
-                                                "downsampled",        "class_not_supported"};
-
-}  // namespace
-
-std::string_view verdictName(TesselReporterClassification classification) {
-  return kNames[classification];
-}
-
-std::optional<TesselReporterClassification> verdictNamed(std::string_view name) {
-  for (const TesselReporterClassification known : kVerdictOrder) {
-    if (verdictName(known) == name) return known;
-  }
-  return {};
-}
-
 uint64_t sumOf(const VerdictCounts& counts) {
   return std::accumulate(counts.begin(), counts.end(), uint64_t{0});
 }

@@ -5,10 +5,10 @@
 
 #pragma once
 
+#include <algorithm>
 #include <array>
 #include <cstdint>
 #include <memory>
-#include <optional>
 #include <string>
 #include <string_view>
 
@@ -16,27 +16,20 @@
 
 namespace tessel::ctl {
 
-inline constexpr size_t kVerdicts = 6;
+// A verdict is a classification as it is shown. Every list of verdicts has this order.
+inline constexpr auto kVerdictOrder = [] {
+  std::array<TesselReporterClassification, kClassifications.size()> order{};
+  std::ranges::transform(kClassifications, order.begin(), &ClassificationRow::code);
+  return order;
+}();
 
-// Reported objects first, then the reasons against reporting, the most interesting ones first.
-// Every list of verdicts is shown in this order.
-inline constexpr std::array<TesselReporterClassification, kVerdicts> kVerdictOrder = {
-    TesselReporterClassificationTelemetryReported,
-    TesselReporterClassificationTelemetryDisabled,
-    TesselReporterClassificationFailedStringWhitelist,
-    TesselReporterClassificationDurationThreshold,
-    TesselReporterClassificationFailedSCFilter,
-    TesselReporterClassificationClassNotSupported,
-};
-
-// The name of a verdict on the command line and in JSON: "reported", "telemetry_disabled",
-// "string_whitelist", "duration", "downsampled", "class_not_supported".
-std::string_view verdictName(TesselReporterClassification classification);
-// Absent where `name` is no verdict.
-std::optional<TesselReporterClassification> verdictNamed(std::string_view name);
+// The name of a verdict on the command line and in JSON.
+constexpr std::string_view verdictName(TesselReporterClassification classification) {
+  return classificationRow(classification).name;
+}
 
 // Trace objects by classification code.
-using VerdictCounts = std::array<uint64_t, kVerdicts>;
+using VerdictCounts = ClassifiedCounts;
 uint64_t sumOf(const VerdictCounts& counts);
 
 // The kind of machine that a judge decides for.

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cctype>
 #include <charconv>
 #include <cmath>
 
@@ -44,22 +45,11 @@ std::string percent(uint64_t part, uint64_t whole) {
   return std::to_string(tenths / 10) + "." + std::to_string(tenths % 10) + " %";
 }
 
+// As the heading of a row or column.
 std::string title(TesselReporterClassification verdict) {
-  switch (verdict) {
-    case TesselReporterClassificationTelemetryReported:
-      return "Reported";
-    case TesselReporterClassificationTelemetryDisabled:
-      return "Not marked for telemetry";
-    case TesselReporterClassificationFailedStringWhitelist:
-      return "A text value is not a known one";
-    case TesselReporterClassificationDurationThreshold:
-      return "Negative duration";
-    case TesselReporterClassificationFailedSCFilter:
-      return "Held back by downsampling";
-    case TesselReporterClassificationClassNotSupported:
-      break;
-  }
-  return "Kind cannot be reported";
+  std::string words(classificationRow(verdict).title);
+  words[0] = static_cast<char>(std::toupper(words[0]));
+  return words;
 }
 
 // "12 reported, 3 downsampled", for a text alternative.

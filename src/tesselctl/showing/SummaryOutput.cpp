@@ -17,15 +17,6 @@ constexpr size_t kShownPairs = 20;
 constexpr size_t kShownMisses = 20;
 constexpr size_t kQuotedWidth = 40;  // columns of a value in a sentence
 
-std::string_view meaningOf(TesselReporterClassification verdict) {
-  // By classification code.
-  static constexpr std::string_view kMeanings[kVerdicts] = {
-      "not marked for telemetry",        "reported",
-      "a text value is not a known one", "its duration is negative",
-      "held back by downsampling",       "its kind cannot be reported"};
-  return kMeanings[verdict];
-}
-
 std::string share(uint64_t part, uint64_t whole) {
   if (whole == 0 || part == 0) return "";
   const uint64_t permille = (part * 1000 + whole / 2) / whole;
@@ -123,7 +114,7 @@ std::string verdictTable(const Tally& tally, const Terminal& terminal) {
         {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
          grouped(count),
          share(count, tally.traceObjects()),
-         std::string(meaningOf(verdict))});
+         std::string(classificationRow(verdict).title)});
   }
   return table.render(terminal, 2);
 }
@@ -155,16 +146,20 @@ struct PairColumn {
   }
 };
 
-// The columns that are not zero throughout; what is reported is always shown.
+// The columns that are not zero throughout; what is reported is always shown. Verdicts that have no
+// column of their own share the last one, so the columns of a row sum up to its objects.
 std::vector<PairColumn> pairColumns(const VerdictCounts& all) {
   std::vector<PairColumn> columns = {
       {"REPORTED", {TesselReporterClassificationTelemetryReported}},
       {"DISABLED", {TesselReporterClassificationTelemetryDisabled}},
       {"UNKNOWN", {TesselReporterClassificationFailedStringWhitelist}},
-      {"THINNED", {TesselReporterClassificationFailedSCFilter}},
-      {"OTHER",
-       {TesselReporterClassificationDurationThreshold,
-        TesselReporterClassificationClassNotSupported}}};
+      {"THINNED", {TesselReporterClassificationFailedSCFilter}}};
+  PairColumn other{"OTHER", {}};
+  for (const auto verdict : kVerdictOrder) {
+    const auto shows = [&](const PairColumn& column) { return column.verdicts[0] == verdict; };
+    if (std::ranges::none_of(columns, shows)) other.verdicts.push_back(verdict);
+  }
+  columns.push_back(std::move(other));
   std::erase_if(columns, [&](const PairColumn& column) {
     return column.verdicts.front() != TesselReporterClassificationTelemetryReported &&
            column.count(all) == 0;
@@ -254,8 +249,9 @@ std::string fileLines(const StoreReport& store, const Terminal& terminal) {
 
 Colour verdictColour(TesselReporterClassification classification) {
   // By classification code.
-  static constexpr Colour kColours[kVerdicts] = {Colour::faint,   Colour::good,    Colour::bad,
-                                                 Colour::caution, Colour::caution, Colour::caution};
+  static constexpr Colour kColours[] = {Colour::faint,   Colour::good,    Colour::bad,
+                                        Colour::caution, Colour::caution, Colour::caution};
+  static_assert(std::size(kColours) == kClassifications.size(), "each verdict needs a colour");
   return kColours[classification];
 }
 
