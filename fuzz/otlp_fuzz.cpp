@@ -7,7 +7,7 @@
 #include <nlohmann/json.hpp>
 #include <string_view>
 
-#include "forwarder/OtlpBody.h"
+#include "forwarder/Encoder.h"
 #include "forwarder/Policy.h"
 #include "platform/PlainText.h"
 
@@ -15,14 +15,19 @@ namespace {
 
 using namespace tessel;
 
+const Encoder& encoder() {
+  static const std::unique_ptr<Encoder>& made = *new std::unique_ptr<Encoder>(
+      outputFormats().front()->makeEncoder({"1", "os", "\xff\"", "amd64", std::nullopt}));
+  return *made;
+}
+
 void checkRow(const SpooledEvent& event) {
-  const auto record = otlpRecord(event, "00112233445566778899aabbccddeeff");
+  const auto record = encoder().record(event, "00112233445566778899aabbccddeeff");
   if (!record) return;
-  if (otlpRecord(event, "00112233445566778899aabbccddeeff") != record) std::abort();
+  if (encoder().record(event, "00112233445566778899aabbccddeeff") != record) std::abort();
   if (!nlohmann::json::accept(event.payload)) std::abort();
   const OutgoingRecord outgoing[] = {{event, *record}, {event, *record}};
-  static const OtlpBody& body = *new OtlpBody({"1", "os", "\xff\"", "amd64", std::nullopt});
-  const auto whole = nlohmann::json::parse(body.around(outgoing), nullptr, false);
+  const auto whole = nlohmann::json::parse(encoder().body(outgoing), nullptr, false);
   if (whole.is_discarded()) std::abort();
 }
 
@@ -30,7 +35,7 @@ void checkAnswer(std::string_view body) {
   CollectorAnswer answer;
   answer.status = 200;
   answer.body = body;
-  partialSuccess(answer.body);
+  encoder().partialSuccess(answer.body);
   answer.status = 400;
   const std::string words = answerWords(answer);
   if (plainText(words, "") != words || words.find('\n') != std::string::npos) std::abort();

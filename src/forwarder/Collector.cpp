@@ -86,8 +86,8 @@ struct CurlCollector::Handles {
   void setFile(CURLoption option, const std::string& path) {
     if (!path.empty()) set(option, path.c_str());
   }
-  void setHeaders(const ForwarderSettings& settings) {
-    headers = curl_slist_append(headers, "Content-Type: application/json");
+  void setHeaders(const ForwarderSettings& settings, std::string_view contentType) {
+    headers = curl_slist_append(headers, ("Content-Type: " + std::string(contentType)).c_str());
     headers = curl_slist_append(headers, "Expect:");
     if (settings.compress) headers = curl_slist_append(headers, "Content-Encoding: gzip");
     for (const std::string& header : settings.headers)
@@ -96,7 +96,7 @@ struct CurlCollector::Handles {
   }
 };
 
-CurlCollector::CurlCollector(const ForwarderSettings& settings)
+CurlCollector::CurlCollector(const ForwarderSettings& settings, std::string_view contentType)
     : compress_(settings.compress), handles_(std::make_unique<Handles>()) {
   Handles& to = *handles_;
   to.set(CURLOPT_URL, settings.url.c_str());
@@ -114,7 +114,7 @@ CurlCollector::CurlCollector(const ForwarderSettings& settings)
   to.setFile(CURLOPT_CAINFO, settings.authorities);
   to.setFile(CURLOPT_SSLCERT, settings.clientCertificate);
   to.setFile(CURLOPT_SSLKEY, settings.clientKey);
-  to.setHeaders(settings);
+  to.setHeaders(settings, contentType);
 }
 
 CurlCollector::~CurlCollector() = default;

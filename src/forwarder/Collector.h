@@ -44,7 +44,7 @@ class Collector {
 
 class CurlCollector final : public Collector {
  public:
-  explicit CurlCollector(const ForwarderSettings& settings);
+  CurlCollector(const ForwarderSettings& settings, std::string_view contentType);
   CurlCollector(const CurlCollector&) = delete;
   CurlCollector& operator=(const CurlCollector&) = delete;
   ~CurlCollector() override;

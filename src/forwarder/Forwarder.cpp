@@ -17,9 +17,8 @@ constexpr std::chrono::milliseconds kBetweenSteps{20};
 
 }  // namespace
 
-Forwarder::Forwarder(World world, OtlpBody body, const ForwarderOptions& options)
+Forwarder::Forwarder(World world, const ForwarderOptions& options)
     : world_(std::move(world)),
-      body_(std::move(body)),
       options_(options),
       backoff_(options.firstRetry, options.longestRetry),
       pace_(options.recordsPerSecond) {}
@@ -34,7 +33,8 @@ ForwarderOutcome Forwarder::deliverAll() {
       return ForwarderOutcome::spoolFailed;
     }
     if (events.empty()) break;
-    const Batch batch = cutBatch(std::move(events), world_.state.spoolId(), options_.maxBytes);
+    const Batch batch =
+        cutBatch(std::move(events), world_.encoder, world_.state.spoolId(), options_.maxBytes);
     if (const ForwarderOutcome outcome = deliverBatch(batch);
         outcome != ForwarderOutcome::delivered) {
       world_.state.storeCounters();
@@ -72,7 +72,7 @@ ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
 }
 
 Forwarder::Sent Forwarder::send(Records part) {
-  const std::string body = body_.around(part);
+  const std::string body = world_.encoder.body(part);
   for (uint32_t failures = 1;; ++failures) {
     if (!takeBreak(pace_.waitAt(ticks()))) return fail(ForwarderOutcome::stopped, "asked to stop");
     pace_.sent(part.size(), ticks());
@@ -106,7 +106,7 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
     return fail(ForwarderOutcome::held, "record after record is refused: " + answerWords(answer));
   }
   refusals_ = 0;
-  const PartialSuccess partial = partialSuccess(answer.body);
+  const PartialSuccess partial = world_.encoder.partialSuccess(answer.body);
   if (partial.rejected > 0) {
     world_.state.counters().rejected += partial.rejected;
     kForwarderLog.error("The collector rejected %llu records: %@", partial.rejected,

@@ -15,9 +15,8 @@
 #include <string>
 #include <vector>
 
-#include "forwarder/Batch.h"
 #include "forwarder/Collector.h"
-#include "forwarder/OtlpBody.h"
+#include "forwarder/Encoder.h"
 #include "forwarder/Policy.h"
 #include "platform/Log.h"
 #include "platform/Queues.h"
@@ -54,6 +53,7 @@ class Forwarder {
   // The outside that it works with; everything outlives it. `chance` draws from [0, 1).
   struct World {
     ForwarderState& state;
+    const Encoder& encoder;
     Collector& collector;
     Clock& clock;
     ServiceStatus& status;
@@ -61,7 +61,7 @@ class Forwarder {
     std::function<double()> chance;
   };
 
-  Forwarder(World world, OtlpBody body, const ForwarderOptions& options);
+  Forwarder(World world, const ForwarderOptions& options);
 
   // Delivers until nothing waits. REQUIRES: the state is open.
   ForwarderOutcome deliverAll();
@@ -84,7 +84,6 @@ class Forwarder {
   std::chrono::nanoseconds ticks();
 
   World world_;
-  const OtlpBody body_;
   const ForwarderOptions options_;
   const Backoff backoff_;
   Pace pace_;

@@ -3,9 +3,7 @@
 #include "forwarder/Policy.h"
 
 #include <algorithm>
-#include <charconv>
 #include <cmath>
-#include <nlohmann/json.hpp>
 
 #include "platform/PlainText.h"
 
@@ -15,16 +13,6 @@ namespace {
 
 constexpr std::chrono::seconds kLongestAsked{3600};
 constexpr size_t kMaxWords = 300;
-
-// A 64-bit integer is a decimal string in OTLP's JSON, but not everybody writes it so.
-uint64_t integerOf(const nlohmann::json& value) {
-  if (value.is_number_unsigned()) return value.get<uint64_t>();
-  uint64_t number = 0;
-  if (const auto* text = value.get_ptr<const std::string*>()) {
-    std::from_chars(text->data(), text->data() + text->size(), number);
-  }
-  return number;
-}
 
 }  // namespace
 
@@ -47,22 +35,6 @@ Verdict verdictOn(const CollectorAnswer& answer) {
   }
   if (answer.status / 100 == 2) return Verdict::accepted;
   return answer.status / 100 == 3 ? Verdict::hold : Verdict::refused;
-}
-
-PartialSuccess partialSuccess(std::string_view body) {
-  const auto json = nlohmann::json::parse(body, nullptr, false);
-  if (!json.is_object()) return {};
-  const auto partial = json.find("partialSuccess");
-  if (partial == json.end() || !partial->is_object()) return {};
-  PartialSuccess told;
-  if (const auto rejected = partial->find("rejectedLogRecords"); rejected != partial->end()) {
-    told.rejected = integerOf(*rejected);
-  }
-  if (const auto message = partial->find("errorMessage");
-      message != partial->end() && message->is_string()) {
-    told.message = message->get<std::string>();
-  }
-  return told;
 }
 
 std::string answerWords(const CollectorAnswer& answer) {

@@ -21,13 +21,6 @@ enum class Verdict {
 
 Verdict verdictOn(const CollectorAnswer& answer);
 
-// What a partial success tells; all zero and empty for any other body.
-struct PartialSuccess {
-  uint64_t rejected = 0;
-  std::string message;
-};
-PartialSuccess partialSuccess(std::string_view body);
-
 // Status and the beginning of the body, or the error, in one line that is fit for a terminal.
 std::string answerWords(const CollectorAnswer& answer);
 

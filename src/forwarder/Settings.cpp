@@ -50,7 +50,7 @@ class Variables {
   std::string path(const std::string& name) const {
     return standard(name).value_or(Variable{}).value;
   }
-  void complain(const std::string& name, const std::string& text, const char* expected) {
+  void complain(const std::string& name, const std::string& text, const std::string& expected) {
     if (!error_) error_ = LaunchError{name, text, expected};
   }
   // A whole number from `least` on.
@@ -141,6 +141,18 @@ bool acceptable(const std::string& text, bool allowHttp) {
   return scheme == "http" && (allowHttp || isLoopback(urlPart(url.get(), CURLUPART_HOST)));
 }
 
+const OutputFormat* readOutput(Variables& variables) {
+  const auto protocol = variables.standard("PROTOCOL");
+  if (!protocol) return outputFormats().front();
+  std::string known;
+  for (const OutputFormat* format : outputFormats()) {
+    if (format->protocol == protocol->value) return format;
+    known.append(known.empty() ? "" : " or ").append(format->protocol);
+  }
+  variables.complain(protocol->name, protocol->value, known);
+  return outputFormats().front();
+}
+
 void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   const bool allowHttp = variables.flag("TESSEL_FORWARD_ALLOW_HTTP");
   const auto endpoint = variables.standard("ENDPOINT");
@@ -151,7 +163,7 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   settings.url = endpoint->value;
   if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
     while (settings.url.ends_with('/')) settings.url.pop_back();
-    settings.url += "/v1/logs";
+    settings.url += settings.output->path;
   }
   if (!acceptable(settings.url, allowHttp)) {
     variables.complain(
@@ -197,11 +209,6 @@ void readTransport(Variables& variables, ForwarderSettings& settings) {
       variables.complain(compression->name, compression->value, "gzip or none");
     }
   }
-  if (const auto protocol = variables.standard("PROTOCOL");
-      protocol && protocol->value != "http/json") {
-    variables.complain(protocol->name, protocol->value,
-                       "http/json, the one protocol that is spoken here");
-  }
   settings.authorities = variables.path("CERTIFICATE");
   settings.clientCertificate = variables.path("CLIENT_CERTIFICATE");
   settings.clientKey = variables.path("CLIENT_KEY");
@@ -213,6 +220,7 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     const EnvironmentReader& environment) {
   ForwarderSettings settings;
   Variables variables(environment);
+  settings.output = readOutput(variables);
   readEndpoint(variables, settings);
   readTransport(variables, settings);
   readCredentials(variables, settings);
@@ -228,6 +236,14 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
   settings.sendInstanceId = variables.flag("TESSEL_FORWARD_INSTANCE_ID");
   if (variables.error()) return *variables.error();
   return settings;
+}
+
+std::variant<const OutputFormat*, LaunchError> readOutputFormat(
+    const EnvironmentReader& environment) {
+  Variables variables(environment);
+  const OutputFormat* const output = readOutput(variables);
+  if (variables.error()) return *variables.error();
+  return output;
 }
 
 }  // namespace tessel

@@ -2,7 +2,7 @@
 //
 // Where to and how follows OpenTelemetry's variables, OTEL_EXPORTER_OTLP_<NAME>, of which
 // OTEL_EXPORTER_OTLP_LOGS_<NAME> comes first: ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE,
-// CLIENT_CERTIFICATE, CLIENT_KEY, PROTOCOL (http/json alone). Secrets are files in
+// CLIENT_CERTIFICATE, CLIENT_KEY, PROTOCOL (an output format). Secrets are files in
 // $CREDENTIALS_DIRECTORY: otlp-headers, otlp-certificate, otlp-client-certificate, otlp-client-key.
 //
 //   TESSEL_FORWARD_RATE        records a second; 0: no limit                        100
@@ -21,11 +21,13 @@
 #include <variant>
 #include <vector>
 
+#include "forwarder/Encoder.h"
 #include "linux/LaunchConfiguration.h"
 
 namespace tessel {
 
 struct ForwarderSettings {
+  const OutputFormat* output = outputFormats().front();
   std::string url;
   std::vector<std::string> headers;  // each "name: value"
   std::chrono::milliseconds timeout{10'000};
@@ -42,6 +44,9 @@ struct ForwarderSettings {
 // The first variable that makes no sense is the error; that there is no endpoint is one. Headers
 // are never quoted in it.
 std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
+    const EnvironmentReader& environment);
+// The output format alone, which needs no endpoint.
+std::variant<const OutputFormat*, LaunchError> readOutputFormat(
     const EnvironmentReader& environment);
 
 }  // namespace tessel

@@ -9,7 +9,6 @@
 #include <iostream>
 #include <random>
 
-#include "forwarder/Batch.h"
 #include "forwarder/Collector.h"
 #include "forwarder/Forwarder.h"
 #include "forwarder/Settings.h"
@@ -32,15 +31,8 @@ double chance() {
   return std::uniform_real_distribution<double>(0, 1)(random);
 }
 
-OtlpBody bodyFor(const LaunchConfiguration& launch, bool sendInstanceId) {
-  ResourceFacts facts = readResourceFacts(launch.osReleasePath);
-  if (sendInstanceId) facts.instanceId = applicationInstanceId();
-  return OtlpBody(facts);
-}
-
 // Prints the bodies of everything that waits, one a line, as they would be sent without a failure.
-int dryRun(const LaunchConfiguration& launch, bool sendInstanceId) {
-  const OtlpBody body = bodyFor(launch, sendInstanceId);
+int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   const ForwarderOptions options;
   ForwarderState state(launch.stateDirectory);
   if (const SqliteStatus status = state.openReadOnly(); !status.ok()) {
@@ -50,9 +42,9 @@ int dryRun(const LaunchConfiguration& launch, bool sendInstanceId) {
   for (int64_t after = 0;;) {
     std::vector<SpooledEvent> events = state.oldest(options.maxRecords, options.maxBytes, after);
     if (events.empty()) return state.status().ok() ? 0 : EX_IOERR;
-    const Batch batch = cutBatch(std::move(events), state.spoolId(), options.maxBytes);
+    const Batch batch = cutBatch(std::move(events), encoder, state.spoolId(), options.maxBytes);
     after = batch.lastId;
-    if (!batch.records.empty()) std::cout << body.around(batch.records) << '\n';
+    if (!batch.records.empty()) std::cout << encoder.body(batch.records) << '\n';
   }
 }
 
@@ -125,13 +117,13 @@ std::string complaint(ForwarderOutcome outcome, const std::string& reason) {
 
 class Service {
  public:
-  Service(const LaunchConfiguration& launch, const ForwarderSettings& settings, Semaphore& stop,
-          Collector& collector)
+  Service(const LaunchConfiguration& launch, const ForwarderSettings& settings,
+          const Encoder& encoder, Semaphore& stop, Collector& collector)
       : settings_(settings),
         stop_(stop),
         state_(launch.stateDirectory),
         manager_(connectServiceManager(clock_)),
-        body_(bodyFor(launch, settings.sendInstanceId)),
+        encoder_(encoder),
         collector_(collector) {}
 
   int runOnce() {
@@ -171,7 +163,8 @@ class Service {
     std::string words;
     ForwarderOutcome outcome = ForwarderOutcome::spoolFailed;
     if (const SqliteStatus opened = state_.open(); opened.ok()) {
-      Forwarder forwarder({state_, collector_, clock_, *manager_, stop_, chance}, body_, options);
+      Forwarder forwarder({state_, encoder_, collector_, clock_, *manager_, stop_, chance},
+                          options);
       outcome = forwarder.deliverAll();
       words = complaint(outcome, forwarder.reason());
     } else {
@@ -187,7 +180,7 @@ class Service {
   SystemClock clock_;
   ForwarderState state_;
   std::unique_ptr<ServiceManager> manager_;
-  const OtlpBody body_;
+  const Encoder& encoder_;
   Collector& collector_;
   Complaints complaints_;
 };
@@ -196,9 +189,11 @@ int forward(const LaunchConfiguration& launch, const ForwarderSettings& settings
   curl_global_init(CURL_GLOBAL_DEFAULT);
   // Used by the signal thread for as long as the process lives.
   auto& stop = *new Semaphore(0);
-  auto& collector = *new CurlCollector(settings);
+  const auto encoder = settings.output->makeEncoder(
+      readResourceFacts(launch.osReleasePath, settings.sendInstanceId));
+  auto& collector = *new CurlCollector(settings, encoder->contentType());
   stopOnSignals(stop, collector);
-  Service service(launch, settings, stop, collector);
+  Service service(launch, settings, *encoder, stop, collector);
   return once ? service.runOnce() : service.runForEver();
 }
 
@@ -216,8 +211,13 @@ int run(const Arguments& arguments) {
       makeLogSink(configuration.logDestination, "statora_forwarder").release();
   setLogSink(sink, configuration.logLevel);
   if (arguments.requeue) return requeue(configuration.stateDirectory);
-  if (arguments.dryRun)
-    return dryRun(configuration, environment("TESSEL_FORWARD_INSTANCE_ID") == "1");
+  if (arguments.dryRun) {
+    const auto output = readOutputFormat(environment);
+    if (const auto* error = std::get_if<LaunchError>(&output)) return complain(*error);
+    const ResourceFacts facts = readResourceFacts(configuration.osReleasePath,
+                                                  environment("TESSEL_FORWARD_INSTANCE_ID") == "1");
+    return dryRun(configuration, *std::get<const OutputFormat*>(output)->makeEncoder(facts));
+  }
   const auto settings = readForwarderSettings(environment);
   if (const auto* error = std::get_if<LaunchError>(&settings)) return complain(*error);
   return forward(configuration, std::get<ForwarderSettings>(settings), arguments.once);

@@ -47,24 +47,24 @@ std::string_view withoutQuotes(std::string_view value) {
   return quoted ? value.substr(1, value.size() - 2) : value;
 }
 
-// The value of the last assignment to VARIANT_ID, as a shell would have it; empty without one.
-std::string_view variantId(std::string_view text) {
-  constexpr std::string_view kAssignment = "VARIANT_ID=";
+}  // namespace
+
+std::string_view osReleaseValue(std::string_view text, std::string_view name) {
   std::string_view value;
   while (!text.empty()) {
     std::string_view line = text.substr(0, text.find('\n'));
     text.remove_prefix(std::min(line.size() + 1, text.size()));
+    if (!line.starts_with(name) || line.substr(name.size(), 1) != "=") continue;
+    line.remove_prefix(name.size() + 1);
     const size_t end = line.find_last_not_of(" \t\r");
-    line = line.substr(0, end == std::string_view::npos ? 0 : end + 1);
-    if (line.starts_with(kAssignment)) value = withoutQuotes(line.substr(kAssignment.size()));
+    value = withoutQuotes(line.substr(0, end == std::string_view::npos ? 0 : end + 1));
   }
   return value;
 }
 
-}  // namespace
-
 OsReleaseBuildVariant::OsReleaseBuildVariant(const std::string& path)
-    : internal_(variantId(readSmallFile(path, kMaxOsReleaseSize).value_or("")) == "internal") {}
+    : internal_(osReleaseValue(readSmallFile(path, kMaxOsReleaseSize).value_or(""), "VARIANT_ID") ==
+                "internal") {}
 
 bool OsReleaseBuildVariant::hasInternalDiagnostics(std::string_view /*subsystem*/) {
   return internal_;

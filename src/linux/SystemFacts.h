@@ -21,6 +21,10 @@ class SystemClock final : public Clock {
   bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
 };
 
+// The value that the text of an os-release file gives `name`, without its quotes. Of several lines
+// the last counts, as for a shell that reads the file. Empty if there is none. Points into `text`.
+std::string_view osReleaseValue(std::string_view text, std::string_view name);
+
 // OsReleaseBuildVariant: the build variant by the operating system's own description of itself.
 //
 // The file is read once, by the constructor; questions are answered from memory. Immutable; any

@@ -1,17 +1,24 @@
-// Writing OTLP's JSON by hand: records are many, and digits of numbers are kept.
+// OTLP over HTTP in JSON: one log record per event.
+//
+// A record has the event's name as `eventName`, its time, and the payload's members as flat
+// attributes in payload order. An attribute has the kind of its member: string, boolean, integer (a
+// decimal string) or double (the very digits of the spool). OTLP has no kind for an unsigned
+// integer above 2^63-1, so that one becomes a string. The attribute `log.record.uid` joins the
+// spool's identifier and the row's id, so that a backend can tell a record that arrives twice from
+// a new one.
+//
+// The JSON is written by hand, because a document tree would cost several allocations per attribute
+// and would print numbers anew: 0.1f must not come out as 0.10000000149.
 
-#include "forwarder/OtlpBody.h"
-
-#include <sys/utsname.h>
-#include <systemd/sd-id128.h>
+#include "forwarder/Encoder.h"
 
 #include <algorithm>
+#include <charconv>
 #include <iterator>
 #include <limits>
 #include <nlohmann/json.hpp>
 #include <utility>
 
-#include "os/Files.h"
 #include "platform/Payload.h"
 
 namespace tessel {
@@ -19,8 +26,6 @@ namespace tessel {
 namespace {
 
 using Json = nlohmann::json;
-
-constexpr size_t kMaxOsReleaseBytes = size_t{64} << 10;
 
 // Members that are always floating-point, also where their digits look like an integer's.
 constexpr std::string_view kFloatingKeys[] = {"DurationInSeconds", "FrameRate",
@@ -96,71 +101,30 @@ class AttributeWriter final : public nlohmann::json_sax<Json> {
   bool inside_ = false;  // the object
 };
 
-// The value of a line NAME=value of an os-release file, quotes removed; empty where there is none.
-std::string osReleaseValue(std::string_view text, std::string_view name) {
-  while (!text.empty()) {
-    std::string_view line = text.substr(0, text.find('\n'));
-    text.remove_prefix(std::min(line.size() + 1, text.size()));
-    if (!line.starts_with(name) || line.substr(name.size(), 1) != "=") continue;
-    line.remove_prefix(name.size() + 1);
-    if (line.size() >= 2 && (line.front() == '"' || line.front() == '\'') &&
-        line.back() == line.front()) {
-      line = line.substr(1, line.size() - 2);
-    }
-    return std::string(line);
+// A 64-bit integer is a decimal string in OTLP's JSON, but not everybody writes it so.
+uint64_t integerOf(const nlohmann::json& value) {
+  if (value.is_number_unsigned()) return value.get<uint64_t>();
+  uint64_t number = 0;
+  if (const auto* text = value.get_ptr<const std::string*>()) {
+    std::from_chars(text->data(), text->data() + text->size(), number);
   }
-  return {};
+  return number;
 }
 
-std::string architectureName() {
-  constexpr std::pair<std::string_view, const char*> kNames[] = {
-      {"x86_64", "amd64"},  {"aarch64", "arm64"}, {"i686", "x86"},
-      {"i586", "x86"},      {"armv7l", "arm32"},  {"armv6l", "arm32"},
-      {"ppc64le", "ppc64"}, {"ppc64", "ppc64"},   {"s390x", "s390x"},
-  };
-  utsname kernel{};
-  if (uname(&kernel) != 0) return {};
-  for (const auto& [machine, name] : kNames) {
-    if (machine == kernel.machine) return name;
-  }
-  return kernel.machine;
-}
+class OtlpEncoder final : public Encoder {
+ public:
+  explicit OtlpEncoder(const ResourceFacts& facts);
+  std::string_view contentType() const override { return "application/json"; }
+  std::optional<std::string> record(const SpooledEvent& event,
+                                    std::string_view spoolId) const override;
+  std::string body(std::span<const OutgoingRecord> records) const override;
+  PartialSuccess partialSuccess(std::string_view answer) const override;
 
-}  // namespace
+ private:
+  std::string head_;  // of every body, up to its first record
+};
 
-ResourceFacts readResourceFacts(const std::string& osReleasePath) {
-  const std::string text = readSmallFile(osReleasePath, kMaxOsReleaseBytes).value_or("");
-  return {TESSEL_VERSION,
-          osReleaseValue(text, "NAME"),
-          osReleaseValue(text, "VERSION_ID"),
-          architectureName(),
-          {}};
-}
-
-std::optional<std::string> applicationInstanceId() {
-  constexpr sd_id128_t kApplication{{0x6b, 0x1d, 0x0a, 0x5c, 0x9e, 0x3f, 0x4f, 0x0c, 0x8b, 0x61,
-                                     0xd2, 0x77, 0x3a, 0x90, 0xe4, 0x15}};
-  sd_id128_t id{};
-  if (sd_id128_get_machine_app_specific(kApplication, &id) < 0) return {};
-  char text[SD_ID128_UUID_STRING_MAX];
-  return sd_id128_to_uuid_string(id, text);
-}
-
-std::optional<std::string> otlpRecord(const SpooledEvent& event, std::string_view spoolId) {
-  const std::string time = std::to_string(event.time) + "000";
-  std::string out =
-      "{\"timeUnixNano\":\"" + time + "\",\"observedTimeUnixNano\":\"" + time + "\",\"eventName\":";
-  appendJsonString(out, event.name);
-  out += ",\"attributes\":[";
-  appendStringAttribute(out, "log.record.uid",
-                        std::string(spoolId) + '-' + std::to_string(event.id));
-  AttributeWriter writer(out);
-  if (!Json::sax_parse(event.payload, &writer)) return {};
-  out += "]}";
-  return out;
-}
-
-OtlpBody::OtlpBody(const ResourceFacts& facts)
+OtlpEncoder::OtlpEncoder(const ResourceFacts& facts)
     : head_("{\"resourceLogs\":[{\"resource\":{\"attributes\":[") {
   auto add = [this, first = true](std::string_view key, std::string_view value) mutable {
     if (value.empty()) return;
@@ -179,18 +143,56 @@ OtlpBody::OtlpBody(const ResourceFacts& facts)
       "\"logRecords\":[";
 }
 
-std::string OtlpBody::around(std::span<const OutgoingRecord> records) const {
+std::optional<std::string> OtlpEncoder::record(const SpooledEvent& event,
+                                               std::string_view spoolId) const {
+  const std::string time = std::to_string(event.time) + "000";
+  std::string out =
+      "{\"timeUnixNano\":\"" + time + "\",\"observedTimeUnixNano\":\"" + time + "\",\"eventName\":";
+  appendJsonString(out, event.name);
+  out += ",\"attributes\":[";
+  appendStringAttribute(out, "log.record.uid",
+                        std::string(spoolId) + '-' + std::to_string(event.id));
+  AttributeWriter writer(out);
+  if (!Json::sax_parse(event.payload, &writer)) return {};
+  out += "]}";
+  return out;
+}
+
+std::string OtlpEncoder::body(std::span<const OutgoingRecord> records) const {
   constexpr std::string_view kTail = "]}]}]}";
   size_t size = head_.size() + kTail.size();
-  for (const OutgoingRecord& record : records) size += record.json.size() + 1;
-  std::string body;
-  body.reserve(size);
-  body = head_;
+  for (const OutgoingRecord& record : records) size += record.text.size() + 1;
+  std::string all;
+  all.reserve(size);
+  all = head_;
   for (const OutgoingRecord& record : records) {
-    if (&record != &records.front()) body += ',';
-    body += record.json;
+    if (&record != &records.front()) all += ',';
+    all += record.text;
   }
-  return body += kTail;
+  return all += kTail;
 }
+
+PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {
+  const auto json = nlohmann::json::parse(answer, nullptr, false);
+  if (!json.is_object()) return {};
+  const auto partial = json.find("partialSuccess");
+  if (partial == json.end() || !partial->is_object()) return {};
+  PartialSuccess told;
+  if (const auto rejected = partial->find("rejectedLogRecords"); rejected != partial->end()) {
+    told.rejected = integerOf(*rejected);
+  }
+  if (const auto message = partial->find("errorMessage");
+      message != partial->end() && message->is_string()) {
+    told.message = message->get<std::string>();
+  }
+  return told;
+}
+
+}  // namespace
+
+extern constexpr OutputFormat kOtlpJson{"http/json", "/v1/logs",
+                                        [](const ResourceFacts& facts) -> std::unique_ptr<Encoder> {
+                                          return std::make_unique<OtlpEncoder>(facts);
+                                        }};
 
 }  // namespace tessel
