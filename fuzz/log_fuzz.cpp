@@ -8,8 +8,7 @@
 #include <string_view>
 
 #include "platform/Log.h"
-#include "platform/Payload.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace {
 

@@ -9,7 +9,7 @@
 
 #include "forwarder/Encoder.h"
 #include "forwarder/Policy.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace {
 

@@ -19,7 +19,7 @@
 #include <nlohmann/json.hpp>
 #include <utility>
 
-#include "platform/Payload.h"
+#include "platform/Json.h"
 
 namespace tessel {
 

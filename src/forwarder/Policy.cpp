@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <cmath>
 
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -14,7 +14,7 @@
 #include <utility>
 
 #include "os/Files.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

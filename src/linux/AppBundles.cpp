@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "os/Files.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

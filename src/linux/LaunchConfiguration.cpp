@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <system_error>
 
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -14,7 +14,7 @@
 #include <systemd/sd-journal.h>
 
 #include "os/Files.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <string_view>
 
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

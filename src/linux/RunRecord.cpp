@@ -9,7 +9,7 @@
 #include <numeric>
 
 #include "os/DurableFile.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -19,7 +19,7 @@
 #include "os/DurableFile.h"
 #include "os/Files.h"
 #include "os/UniqueFd.h"
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -19,7 +19,6 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Number.h"
 #include "platform/Payload.h"
 #include "platform/SharedString.h"
 

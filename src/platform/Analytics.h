@@ -9,7 +9,6 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Number.h"
 #include "platform/Payload.h"
 #include "platform/Queues.h"
 

@@ -3,7 +3,7 @@
 #include "service/BootVolume.h"
 
 #include "platform/Log.h"
-#include "platform/Payload.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -149,7 +149,7 @@ void Spool::endRun() { close(); }
 bool Spool::sendEvent(std::string_view name, const Payload& payload) {
   const int64_t time = clock_.now().time_since_epoch().count();
   const std::string text = payloadJson(payload);
-  const std::string validName = isValidUtf8(name) ? std::string(name) : replaceInvalidUtf8(name);
+  const std::string validName = replaceInvalidUtf8(name);
   SqliteStatus status = store(validName, text, time);
   if (isDamage(status) && figures_.setAside.empty() && setAside())
     status = store(validName, text, time);

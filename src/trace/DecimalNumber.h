@@ -5,7 +5,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Number.h"
+#include "platform/Payload.h"
 
 namespace tessel {
 

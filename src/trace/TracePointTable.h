@@ -17,7 +17,7 @@
 
 #include "journal/EntryStream.h"
 #include "platform/FlatIndex.h"
-#include "platform/Number.h"
+#include "platform/Payload.h"
 #include "platform/SharedString.h"
 #include "trace/TracePointFields.h"
 

@@ -8,7 +8,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Number.h"
+#include "platform/Json.h"
 #include "platform/Payload.h"
 #include "platform/SharedString.h"
 

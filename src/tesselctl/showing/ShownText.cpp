@@ -3,53 +3,17 @@
 #include "tesselctl/showing/ShownText.h"
 
 #include <unicode/uchar.h>
-#include <unicode/utf8.h>
 
 #include <algorithm>
-#include <array>
-#include <charconv>
 #include <vector>
 
 #include "platform/Payload.h"
-#include "platform/PlainText.h"
 
 namespace tessel::ctl {
 
 namespace {
 
 constexpr std::string_view kEllipsis = "\u2026";
-
-struct Character {
-  std::string_view bytes;
-  char32_t point = 0;
-};
-
-// Calls `visit(Character)` on each character of well-formed UTF-8.
-template <typename Visit>
-void forEachCharacter(std::string_view text, Visit&& visit) {
-  const auto* bytes = reinterpret_cast<const uint8_t*>(text.data());
-  for (size_t at = 0; at < text.size();) {
-    const size_t begin = at;
-    UChar32 point = 0;
-    U8_NEXT_OR_FFFD(bytes, at, text.size(), point);
-    visit(Character{text.substr(begin, at - begin), static_cast<char32_t>(point)});
-  }
-}
-
-// Line and paragraph separators, and what changes the direction of the text around it.
-bool rearrangesText(char32_t point) {
-  return point == 0x2028 || point == 0x2029 || point == 0x061c || point == 0x200e ||
-         point == 0x200f || (point >= 0x202a && point <= 0x202e) ||
-         (point >= 0x2066 && point <= 0x2069);
-}
-
-bool isControl(char32_t point) { return point < 0x20 || (point >= 0x7f && point < 0xa0); }
-
-void appendUnicodeEscape(std::string& out, char32_t point) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  out += "\\u";
-  for (int shift = 12; shift >= 0; shift -= 4) out += kDigits[(point >> shift) & 0xf];
-}
 
 size_t widthOf(char32_t point) {
   switch (u_charType(static_cast<UChar32>(point))) {
@@ -98,21 +62,6 @@ std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
 
 }  // namespace
 
-std::string terminalText(std::string_view text) {
-  if (isPlainAscii(text)) return std::string(text);
-  std::string out;
-  forEachCharacter(plainText(text, "\\x0a"), [&](const Character& character) {
-    if (character.point == '\t') {
-      out += "\\x09";
-    } else if (rearrangesText(character.point)) {
-      appendUnicodeEscape(out, character.point);
-    } else {
-      out += character.bytes;
-    }
-  });
-  return out;
-}
-
 std::string terminalJson(std::string_view json) {
   if (isPlainAscii(json)) return std::string(json);
   std::string out;
@@ -120,42 +69,8 @@ std::string terminalJson(std::string_view json) {
   forEachCharacter(json, [&](const Character& character) {
     if (character.point < 0x20) {
       out += ' ';
-    } else if (isControl(character.point) || rearrangesText(character.point)) {
+    } else if (isObeyed(character.point)) {
       appendUnicodeEscape(out, character.point);
-    } else {
-      out += character.bytes;
-    }
-  });
-  return out;
-}
-
-std::string htmlText(std::string_view text) {
-  std::string out;
-  out.reserve(text.size());
-  forEachCharacter(replaceInvalidUtf8(text), [&](const Character& character) {
-    switch (character.point) {
-      case '&':
-        out += "&amp;";
-        return;
-      case '<':
-        out += "&lt;";
-        return;
-      case '>':
-        out += "&gt;";
-        return;
-      case '"':
-        out += "&quot;";
-        return;
-      case '\'':
-        out += "&#39;";
-        return;
-      default:
-        break;
-    }
-    if (character.point < 0x20) {
-      out += "&#" + std::to_string(0x2400 + static_cast<uint32_t>(character.point)) + ";";
-    } else if (isControl(character.point) || rearrangesText(character.point)) {
-      out += "\ufffd";
     } else {
       out += character.bytes;
     }
@@ -175,15 +90,5 @@ std::string shortened(std::string_view text, size_t width) {
 }
 
 std::string cutOff(std::string_view text, size_t width) { return abridged(text, width, 0); }
-
-std::string grouped(uint64_t number) {
-  std::string digits = std::to_string(number);
-  for (size_t at = digits.size(); at > 3; at -= 3) digits.insert(at - 3, ",");
-  return digits;
-}
-
-std::string counted(uint64_t number, std::string_view singular, std::string_view plural) {
-  return grouped(number).append(" ").append(number == 1 ? singular : plural);
-}
 
 }  // namespace tessel::ctl

@@ -5,23 +5,16 @@
 
 #pragma once
 
-#include <cstdint>
 #include <string>
 #include <string_view>
 
-namespace tessel::ctl {
+#include "platform/Text.h"
 
-// One line for a terminal: control characters and bytes that are no UTF-8 as \xNN, characters that
-// reorder or break a line as \uNNNN.
-std::string terminalText(std::string_view text);
+namespace tessel::ctl {
 
 // JSON that is valid already, made one line that a terminal may be shown: what JSON leaves bare
 // but a terminal may obey becomes \uNNNN, line breaks between tokens become spaces.
 std::string terminalJson(std::string_view json);
-
-// Content of an element or of a quoted attribute: nothing in it is markup, bytes that are no UTF-8
-// become U+FFFD, control characters become their pictures.
-std::string htmlText(std::string_view text);
 
 // Columns that `text`, which terminalText() answered, takes on a terminal.
 size_t displayWidth(std::string_view text);
@@ -31,10 +24,5 @@ size_t displayWidth(std::string_view text);
 std::string shortened(std::string_view text, size_t width);
 // The same, but it is the end that goes.
 std::string cutOff(std::string_view text, size_t width);
-
-// "1,234,567".
-std::string grouped(uint64_t number);
-// "1 event", "2 events".
-std::string counted(uint64_t number, std::string_view singular, std::string_view plural);
 
 }  // namespace tessel::ctl

@@ -1,0 +1,158 @@
+// Punctuation, string escapes and digits of JSON.
+
+#include "platform/Json.h"
+
+#include <charconv>
+#include <cmath>
+
+#include "platform/Text.h"
+
+namespace tessel {
+
+namespace {
+
+// JSON's escapes of one letter, those that are shorter than \uNNNN.
+char shortEscape(char32_t point) {
+  switch (point) {
+    case '"':
+    case '\\':
+      return static_cast<char>(point);
+    case '\b':
+      return 'b';
+    case '\f':
+      return 'f';
+    case '\n':
+      return 'n';
+    case '\r':
+      return 'r';
+    case '\t':
+      return 't';
+    default:
+      return '\0';
+  }
+}
+
+// JSON wants the C0 controls escaped; DEL is escaped with them, since it is one to every reader but
+// a JSON parser. JSON leaves the C1 controls and the marks of direction bare, a terminal obeys
+// them: for a terminal they are escaped as well, which means the same string to a parser. Whoever
+// looks at `tesselctl --json` on a screen is then as safe as with the tables.
+bool isEscaped(char32_t point, bool forTerminal) {
+  return point < 0x20 || point == 0x7f || (forTerminal && isObeyed(point));
+}
+
+template <typename Value>
+void appendDigits(std::string& out, Value value) {
+  char buffer[32];  // the longest is a double: a sign, 17 digits, a point and "e-308"
+  out.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, value).ptr);
+}
+
+}  // namespace
+
+void appendJsonString(std::string& out, std::string_view text, bool forTerminal) {
+  out += '"';
+  appendEscaped(
+      out, text,
+      [=](const Character& character) {
+        return character.valid && character.point != '"' && character.point != '\\' &&
+               !isEscaped(character.point, forTerminal);
+      },
+      [&](const Character& character) {
+        if (!character.valid)
+          out += "\xef\xbf\xbd";
+        else if (const char letter = shortEscape(character.point); letter != '\0')
+          (out += '\\') += letter;
+        else
+          appendUnicodeEscape(out, character.point);
+      });
+  out += '"';
+}
+
+// Valid JSON has its own controls escaped, so a bare one stands between tokens and a space does as
+// well. What a terminal may obey beyond them can only stand in a string, where an escape means the
+// same.
+JsonWriter& JsonWriter::raw(std::string_view json) {
+  separate();
+  if (!style_.forTerminal) {
+    out_ += json;
+    return *this;
+  }
+  appendEscaped(
+      out_, json, [](const Character& character) { return !isObeyed(character.point); },
+      [this](const Character& character) {
+        if (character.point < 0x20)
+          out_ += ' ';
+        else
+          appendUnicodeEscape(out_, character.point);
+      });
+  return *this;
+}
+
+JsonWriter& JsonWriter::key(std::string_view name) {
+  string(name);
+  out_ += style_.indent == 0 ? ":" : ": ";
+  place_ = Place::key;
+  return *this;
+}
+
+void JsonWriter::open(char bracket) {
+  separate();
+  out_ += bracket;
+  ++depth_;
+  place_ = Place::opening;
+}
+
+void JsonWriter::close(char bracket) {
+  --depth_;
+  if (place_ == Place::value) newLine();
+  out_ += bracket;
+  place_ = Place::value;
+}
+
+// Called before each key and value. The comma depends on what stands before it alone, so no stack
+// of open brackets is kept.
+void JsonWriter::separate() {
+  if (place_ == Place::value) out_ += ',';
+  if (place_ == Place::value || place_ == Place::opening) newLine();
+  place_ = Place::value;
+}
+
+void JsonWriter::newLine() {
+  if (style_.indent != 0) out_.append(1, '\n').append(depth_ * style_.indent, ' ');
+}
+
+void JsonWriter::string(std::string_view text) {
+  separate();
+  appendJsonString(out_, text, style_.forTerminal);
+}
+
+void JsonWriter::number(int64_t value) {
+  separate();
+  appendDigits(out_, value);
+}
+
+void JsonWriter::number(uint64_t value) {
+  separate();
+  appendDigits(out_, value);
+}
+
+// A float is not widened: the shortest digits of 0.1f are "0.1", those of the same number as a
+// double are "0.10000000149011612", which nobody recorded.
+void JsonWriter::number(float value) {
+  if (!std::isfinite(value)) {
+    raw("null");
+    return;
+  }
+  separate();
+  appendDigits(out_, value);
+}
+
+void JsonWriter::number(double value) {
+  if (!std::isfinite(value)) {
+    raw("null");
+    return;
+  }
+  separate();
+  appendDigits(out_, value);
+}
+
+}  // namespace tessel

@@ -1,0 +1,137 @@
+// JsonWriter: writes one JSON value, front to back, into a text that the caller owns.
+//
+//   json.object([&] {
+//     json.member("name", name).member("count", count);
+//     json.array("files", files, [&](const File& file) { json.value(file.path); });
+//   });
+//
+// Everything that this system writes as JSON passes through here: payloads in the spool, the run
+// record, what is sent and what tesselctl prints. Only what is read back needs a parser. A writer
+// is used by one thread at a time.
+
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <type_traits>
+#include <utility>
+#include <variant>
+
+namespace tessel {
+
+struct JsonStyle {
+  // Nothing in the JSON is left that a terminal may obey.
+  bool forTerminal = false;
+  // Spaces for each level; 0 writes all on one line, without any.
+  size_t indent = 0;
+};
+
+// Appends `text` as a JSON string. Each maximal invalid part of its UTF-8 becomes U+FFFD.
+void appendJsonString(std::string& out, std::string_view text, bool forTerminal = false);
+
+class JsonWriter {
+ public:
+  explicit JsonWriter(std::string& out, JsonStyle style = {}) : out_(out), style_(style) {}
+  JsonWriter(const JsonWriter&) = delete;
+  JsonWriter& operator=(const JsonWriter&) = delete;
+
+  // A text, a number, a bool, a date (microseconds since 1970), what an optional holds, or what a
+  // variant of these holds. Numbers get the shortest digits that read back as the same number of
+  // their own type. One that is not finite is null, which is what JSON can say of it.
+  template <typename T>
+  JsonWriter& value(const T& value);
+  // `json` is one valid JSON value in UTF-8.
+  JsonWriter& raw(std::string_view json);
+
+  // Members of an object. An absent text and an empty optional leave out their key as well.
+  template <typename T>
+  JsonWriter& member(std::string_view name, const T& value);
+  JsonWriter& rawMember(std::string_view name, std::string_view json) {
+    return key(name).raw(json);
+  }
+
+  // An object, whose members `write()` writes.
+  template <typename Write>
+  JsonWriter& object(Write&& write);
+  template <typename Write>
+  JsonWriter& object(std::string_view name, Write&& write) {
+    return key(name).object(std::forward<Write>(write));
+  }
+  // An array; `write(item)` writes the value for each of `items`.
+  template <typename Items, typename Write>
+  JsonWriter& array(std::string_view name, const Items& items, Write&& write);
+
+ private:
+  // What stands before the place that is written next.
+  enum class Place { nothing, opening, key, value };
+
+  JsonWriter& key(std::string_view name);
+  void open(char bracket);
+  void close(char bracket);
+  void separate();
+  void newLine();
+  void string(std::string_view text);
+  void number(int64_t value);
+  void number(uint64_t value);
+  void number(float value);
+  void number(double value);
+
+  std::string& out_;
+  const JsonStyle style_;
+  size_t depth_ = 0;
+  Place place_ = Place::nothing;
+};
+
+template <typename T>
+JsonWriter& JsonWriter::value(const T& value) {
+  if constexpr (std::is_convertible_v<const T&, std::string_view>) {
+    string(value);
+  } else if constexpr (std::is_same_v<T, bool>) {
+    raw(value ? "true" : "false");
+  } else if constexpr (std::is_floating_point_v<T>) {
+    number(value);
+  } else if constexpr (std::is_signed_v<T>) {
+    number(int64_t{value});
+  } else if constexpr (std::is_integral_v<T> || std::is_enum_v<T>) {
+    number(static_cast<uint64_t>(value));
+  } else if constexpr (requires { value.text(); }) {
+    string(value.text());
+  } else if constexpr (requires { value.time_since_epoch(); }) {
+    number(int64_t{value.time_since_epoch().count()});
+  } else if constexpr (requires { value.has_value(); }) {
+    this->value(*value);
+  } else {
+    std::visit([this](const auto& held) { this->value(held); }, value);
+  }
+  return *this;
+}
+
+template <typename T>
+JsonWriter& JsonWriter::member(std::string_view name, const T& value) {
+  if constexpr (requires { value.present(); }) {
+    if (!value.present()) return *this;
+  } else if constexpr (requires { value.has_value(); }) {
+    if (!value.has_value()) return *this;
+  }
+  return key(name).value(value);
+}
+
+template <typename Write>
+JsonWriter& JsonWriter::object(Write&& write) {
+  open('{');
+  write();
+  close('}');
+  return *this;
+}
+
+template <typename Items, typename Write>
+JsonWriter& JsonWriter::array(std::string_view name, const Items& items, Write&& write) {
+  key(name).open('[');
+  for (const auto& item : items) write(item);
+  close(']');
+  return *this;
+}
+
+}  // namespace tessel

@@ -1,0 +1,207 @@
+// Walking through UTF-8 and escaping what must not be shown as it is.
+//
+// The walk decodes by hand. The C library decodes by the locale of the process, which a service
+// must not depend on, and the Unicode library is too much for the rooms that only use the standard
+// library. Decoding costs a table of four lengths and two exceptions.
+
+#include "platform/Text.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr std::string_view kReplacementCharacter = "\xef\xbf\xbd";
+
+// What may follow a lead byte. `length` is 0 where nothing begins with that byte.
+struct Sequence {
+  size_t length = 0;
+  unsigned lowestSecond = 0x80;
+  unsigned highestSecond = 0xbf;
+};
+
+// The second byte alone decides whether a sequence is the shortest for its code point (after E0 and
+// F0), no surrogate (after ED), and within Unicode (after F4). Once it is checked, any continuation
+// byte will do for the rest. C0 and C1 could only write ASCII in two bytes, so they begin nothing.
+Sequence sequenceOf(unsigned lead) {
+  if (lead >= 0xc2 && lead <= 0xdf) return {2};
+  if (lead >= 0xe0 && lead <= 0xef)
+    return {3, lead == 0xe0 ? 0xa0U : 0x80U, lead == 0xed ? 0x9fU : 0xbfU};
+  if (lead >= 0xf0 && lead <= 0xf4)
+    return {4, lead == 0xf0 ? 0x90U : 0x80U, lead == 0xf4 ? 0x8fU : 0xbfU};
+  return {};
+}
+
+unsigned byteAt(std::string_view text, size_t at) { return static_cast<unsigned char>(text[at]); }
+
+void appendByteEscapes(std::string& out, std::string_view bytes) {
+  constexpr std::string_view kDigits = "0123456789abcdef";
+  for (size_t at = 0; at < bytes.size(); ++at) {
+    out += "\\x";
+    out += kDigits[byteAt(bytes, at) >> 4];
+    out += kDigits[byteAt(bytes, at) & 0xf];
+  }
+}
+
+std::string_view markupFor(char32_t point) {
+  switch (point) {
+    case '&':
+      return "&amp;";
+    case '<':
+      return "&lt;";
+    case '>':
+      return "&gt;";
+    case '"':
+      return "&quot;";
+    case '\'':
+      return "&#39;";
+    default:
+      return {};
+  }
+}
+
+}  // namespace
+
+Character firstCharacter(std::string_view rest) {
+  const unsigned lead = byteAt(rest, 0);
+  if (lead < 0x80) return {rest.substr(0, 1), lead, true};
+  const Sequence sequence = sequenceOf(lead);
+  if (sequence.length == 0) return {rest.substr(0, 1)};
+  // An invalid part ends before the first byte that cannot continue it. That byte may begin a
+  // character of its own: a text that was cut within a character and joined to another loses no
+  // more than the character that was cut.
+  char32_t point = lead & (0x7fU >> sequence.length);
+  for (size_t at = 1; at < sequence.length; ++at) {
+    const unsigned low = at == 1 ? sequence.lowestSecond : 0x80;
+    const unsigned high = at == 1 ? sequence.highestSecond : 0xbf;
+    if (at == rest.size() || byteAt(rest, at) < low || byteAt(rest, at) > high)
+      return {rest.substr(0, at)};
+    point = point << 6 | (byteAt(rest, at) & 0x3f);
+  }
+  return {rest.substr(0, sequence.length), point, true};
+}
+
+// Terminals obey the C1 controls in UTF-8, too: U+009B begins a sequence just as ESC [ does. U+2028
+// and U+2029 break a line. The others set the direction of what follows: behind U+202E a terminal
+// shows the rest of the line backwards, so that a recorded name could pass itself off as another
+// one or hide the verdict beside it.
+bool isObeyed(char32_t point) {
+  return isControl(point) || point == 0x2028 || point == 0x2029 || point == 0x061c ||
+         point == 0x200e || point == 0x200f || (point >= 0x202a && point <= 0x202e) ||
+         (point >= 0x2066 && point <= 0x2069);
+}
+
+void appendUnicodeEscape(std::string& out, char32_t point) {
+  constexpr std::string_view kDigits = "0123456789abcdef";
+  out += "\\u";
+  for (int shift = 12; shift >= 0; shift -= 4) out += kDigits[(point >> shift) & 0xf];
+}
+
+bool isValidUtf8(std::string_view text) {
+  while (!text.empty()) {
+    const Character character = firstCharacter(text);
+    if (!character.valid) return false;
+    text.remove_prefix(character.bytes.size());
+  }
+  return true;
+}
+
+std::string replaceInvalidUtf8(std::string_view text) {
+  std::string out;
+  appendEscaped(
+      out, text, [](const Character& character) { return character.valid; },
+      [&](const Character&) { out += kReplacementCharacter; });
+  return out;
+}
+
+// A backslash stays as it is. Escaped text is for people; whoever must tell a recorded "\x1b" from
+// an escaped one takes the JSON output.
+std::string terminalText(std::string_view text) {
+  std::string out;
+  appendEscaped(
+      out, text,
+      [](const Character& character) { return character.valid && !isObeyed(character.point); },
+      [&](const Character& character) {
+        if (character.valid && !isControl(character.point))
+          appendUnicodeEscape(out, character.point);
+        else
+          appendByteEscapes(out, character.bytes);
+      });
+  return out;
+}
+
+// Logs keep characters that reorder a line: the languages that are written from right to left need
+// them, and a log line decides nothing about the line beside it.
+std::string plainText(std::string_view text, std::string_view lineFeed) {
+  std::string out;
+  out.reserve(text.size());
+  appendEscaped(
+      out, text,
+      [](const Character& character) {
+        return character.valid && (!isControl(character.point) || character.point == '\t');
+      },
+      [&](const Character& character) {
+        if (character.point == '\n')
+          out += lineFeed;
+        else
+          appendByteEscapes(out, character.bytes);
+      });
+  return out;
+}
+
+// Three quarters of the room go to the end, since these texts are mostly paths and reasons: the end
+// of a path says more than its middle. The least maximum leaves room for both ends and the longest
+// escape.
+std::string shortPlainText(std::string_view text, size_t maximum) {
+  constexpr std::string_view kLeftOut = "...";
+  std::string plain = plainText(text, "\\x0a");
+  if (plain.size() <= maximum) return plain;
+  // The cut moves outwards to the next character, so that what is left is UTF-8 and still fits.
+  const auto insideCharacter = [&](size_t at) { return (byteAt(plain, at) & 0xc0) == 0x80; };
+  size_t head = maximum / 4;
+  size_t tail = plain.size() - (maximum - head - kLeftOut.size());
+  while (insideCharacter(head)) --head;
+  while (tail < plain.size() && insideCharacter(tail)) ++tail;
+  return plain.substr(0, head).append(kLeftOut).append(plain, tail);
+}
+
+// A page must not hold most controls, not even as a reference by number, so each becomes the
+// visible picture that Unicode keeps at U+2400 plus its number. The later controls have no picture.
+std::string htmlText(std::string_view text) {
+  constexpr uint32_t kControlPictures = 0x2400;
+  std::string out;
+  out.reserve(text.size());
+  appendEscaped(
+      out, text,
+      [](const Character& character) {
+        return character.valid && !isObeyed(character.point) && markupFor(character.point).empty();
+      },
+      [&](const Character& character) {
+        if (character.point < 0x20)
+          out += "&#" + std::to_string(kControlPictures + character.point) + ";";
+        else if (isObeyed(character.point) || !character.valid)
+          out += kReplacementCharacter;
+        else
+          out += markupFor(character.point);
+      });
+  return out;
+}
+
+std::string_view trimmed(std::string_view text, std::string_view blanks) {
+  const size_t begin = text.find_first_not_of(blanks);
+  if (begin == std::string_view::npos) return {};
+  return text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
+}
+
+// Commas always: the locale of whoever calls the tool must not change what a script or a test
+// compares.
+std::string grouped(uint64_t number) {
+  std::string digits = std::to_string(number);
+  for (size_t at = digits.size(); at > 3; at -= 3) digits.insert(at - 3, ",");
+  return digits;
+}
+
+std::string counted(uint64_t number, std::string_view singular, std::string_view plural) {
+  return grouped(number).append(" ").append(number == 1 ? singular : plural);
+}
+
+}  // namespace tessel

@@ -1,0 +1,93 @@
+// Text: a walk through UTF-8, and the escapes that make a text of unknown origin fit to be shown.
+//
+// Programs record what they like, and others write into the files that we read. Each such text
+// passes one of the escapes below on its way to a terminal or into markup, or that of Json.h into
+// JSON. All of them stand on one walk, so all of them agree on what is a character.
+//
+// Stateless; any thread.
+
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+namespace tessel {
+
+// A well-formed UTF-8 sequence, or bytes that belong to none.
+struct Character {
+  std::string_view bytes;
+  char32_t point = 0xfffd;  // code point; U+FFFD for bytes that are not valid
+  bool valid = false;
+};
+
+// The character that `rest` begins with. Invalid bytes come in maximal parts: as many as could
+// begin a well-formed sequence, at least one. REQUIRES: rest is not empty.
+Character firstCharacter(std::string_view rest);
+
+// Calls `visit(const Character&)` on each character of `text`, first to last.
+template <typename Visit>
+void forEachCharacter(std::string_view text, Visit&& visit) {
+  while (!text.empty()) {
+    const Character character = firstCharacter(text);
+    visit(character);
+    text.remove_prefix(character.bytes.size());
+  }
+}
+
+// Appends `text` to `out`. For each character that `isPlain(const Character&)` refuses,
+// `escape(const Character&)` appends what stands in its place. Plain runs are copied whole.
+template <typename IsPlain, typename Escape>
+void appendEscaped(std::string& out, std::string_view text, IsPlain&& isPlain, Escape&& escape) {
+  size_t plain = 0;  // bytes of `text` that are plain and not yet copied
+  size_t copied = 0;
+  forEachCharacter(text, [&](const Character& character) {
+    if (isPlain(character)) {
+      plain += character.bytes.size();
+      return;
+    }
+    out.append(text, copied, plain);
+    escape(character);
+    copied += plain + character.bytes.size();
+    plain = 0;
+  });
+  out.append(text, copied, plain);
+}
+
+// The C0 controls, DEL, and the C1 controls.
+constexpr bool isControl(char32_t point) { return point < 0x20 || (point >= 0x7f && point < 0xa0); }
+// Whether a terminal obeys the character, or shows its neighbours in another order or line.
+bool isObeyed(char32_t point);
+// Appends \uNNNN. REQUIRES: point <= 0xffff.
+void appendUnicodeEscape(std::string& out, char32_t point);
+
+bool isValidUtf8(std::string_view text);
+// `text` with one U+FFFD for each maximal invalid part.
+std::string replaceInvalidUtf8(std::string_view text);
+
+// For a terminal: one line that moves no cursor, changes no colour and keeps its order. Controls
+// and invalid bytes become \xNN, characters that reorder or break a line become \uNNNN.
+std::string terminalText(std::string_view text);
+
+// For a log: as terminalText(), but tabs and characters that reorder a line stay, and a line feed
+// becomes `lineFeed`.
+std::string plainText(std::string_view text, std::string_view lineFeed);
+
+// plainText() with a line feed as \x0a, at most `maximum` bytes of it. A text that is too long
+// loses its middle to "...". REQUIRES: maximum >= 16.
+std::string shortPlainText(std::string_view text, size_t maximum);
+
+// For markup: the content of an element or of a quoted attribute. Invalid bytes become U+FFFD;
+// controls below U+0020 become the pictures of them that Unicode has, others U+FFFD.
+std::string htmlText(std::string_view text);
+
+// `text` without the blanks at either end of it.
+std::string_view trimmed(std::string_view text, std::string_view blanks = " \t\r\n");
+
+// "1,234,567".
+std::string grouped(uint64_t number);
+// "1 event", "2 events", "1,000 events".
+std::string counted(uint64_t number, std::string_view singular, std::string_view plural);
+
+}  // namespace tessel
