@@ -13,7 +13,7 @@
 #include <thread>
 #include <utility>
 
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

@@ -16,6 +16,7 @@
 #include "os/DurableFile.h"
 #include "os/UniqueFd.h"
 #include "platform/Log.h"
+#include "platform/Text.h"
 
 namespace tessel {
 

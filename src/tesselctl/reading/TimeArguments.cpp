@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <ctime>
 
-#include "platform/PlainText.h"
+#include "platform/Text.h"
 
 namespace tessel::ctl {
 
