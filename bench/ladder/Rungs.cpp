@@ -39,7 +39,7 @@ uint64_t readAlone(const std::string& directory) {
   Glance glance;
   StopFlag stop{false};
   auto opened = TraceStore::open(directory, {}, glance, stop);
-  if (auto* error = std::get_if<PlatformError>(&opened)) fail(error->localizedDescription);
+  if (auto* error = std::get_if<PlatformError>(&opened)) fail(error->words);
   EntryStream& entries = std::get<0>(opened)->entries();
   uint64_t count = 0;
   size_t tokens = 0;
@@ -58,7 +58,7 @@ uint64_t readAndPair(const std::string& directory) {
   extractor.setAnimationIntervalCompletionProcessingBlock([](const auto&) { return true; });
   std::optional<PlatformError> error;
   if (!extractor.processLogArchiveWithPath(directory, Date{}, Date::max(), error))
-    fail(error->localizedDescription);
+    fail(error->words);
   return extractor.processedEventCount();
 }
 

@@ -42,7 +42,8 @@ std::string firstLineOf(const char* path) {
 }
 
 PlatformError failure(const std::string& path, const std::string& doing, int error) {
-  return {"Cannot " + doing + " " + path + ": " + std::generic_category().message(error)};
+  return {codeOf(error),
+          "Cannot " + doing + " " + path + ": " + std::generic_category().message(error)};
 }
 
 uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
@@ -182,7 +183,7 @@ std::optional<PlatformError> appendToExportFile(const std::string& directory,
   if (!directory.ends_with(".export")) {
     std::error_code error;
     std::filesystem::create_directories(directory, error);
-    if (error) return PlatformError{"Cannot make " + directory + ": " + error.message()};
+    if (error) return failure(directory, "make", error.value());
     path += "/tessel.export";
   }
   const UniqueFd file(::open(path.c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0644));

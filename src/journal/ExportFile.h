@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
-#include "objects/TesselSupportObjectExtractor.h"
+#include "platform/Error.h"
 
 namespace tessel {
 

@@ -6,8 +6,9 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <system_error>
 #include <utility>
+
+#include "os/Files.h"
 
 namespace tessel {
 
@@ -82,14 +83,15 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
 }
 
 // The size is asked for last, so that it covers all that the header counts.
-std::variant<JournalBeginning, std::string> readJournalHeader(int fd) {
+std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
   std::array<uint8_t, kHeaderRead> bytes;
   const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
   struct stat status {};
-  if (got < 0 || ::fstat(fd, &status) != 0) return std::generic_category().message(errno);
+  if (got < 0 || ::fstat(fd, &status) != 0) return PlatformError{codeOf(errno), errorWords(errno)};
   const auto fileSize = static_cast<uint64_t>(status.st_size);
   auto parsed = parseJournalHeader(std::span(bytes).first(static_cast<size_t>(got)), fileSize);
-  if (auto* reason = std::get_if<std::string>(&parsed)) return std::move(*reason);
+  if (auto* reason = std::get_if<std::string>(&parsed))
+    return PlatformError{ErrorCode::notAStore, std::move(*reason)};
   return JournalBeginning{std::get<JournalHeader>(parsed), fileSize};
 }
 

@@ -17,6 +17,7 @@
 #include "journal/EntryStream.h"
 #include "journal/JournalFormat.h"
 #include "journal/WindowedFile.h"
+#include "platform/Error.h"
 
 namespace tessel {
 
@@ -52,8 +53,8 @@ struct JournalBeginning {
   uint64_t fileSize = 0;  // bytes
 };
 
-// Reads the header of the file of `fd`; the reason where it cannot be read or is no journal.
-std::variant<JournalBeginning, std::string> readJournalHeader(int fd);
+// Reads the header of the file of `fd`. The error is notAStore if the file is no journal.
+std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd);
 
 struct ObjectHeader {
   uint8_t type = 0;

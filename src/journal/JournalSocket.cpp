@@ -15,8 +15,8 @@ namespace {
 constexpr const char* kSocket = "/run/systemd/journal/socket";
 
 PlatformError failure(int error) {
-  return {std::string("Cannot write to the journal at ") + kSocket + ": " +
-          std::generic_category().message(error)};
+  return {codeOf(error), std::string("Cannot write to the journal at ") + kSocket + ": " +
+                             std::generic_category().message(error)};
 }
 
 }  // namespace

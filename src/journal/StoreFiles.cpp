@@ -136,21 +136,23 @@ void allowOpenFiles(size_t count) {
 }
 
 PlatformError storeError(const std::string& path, int error) {
-  return {path + ": " + whyNotOpened(error)};
+  return {codeOf(error), path + ": " + whyNotOpened(error)};
 }
 
 std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
   std::string machine;
   std::ifstream("/etc/machine-id") >> machine;
   if (machine.empty())
-    return PlatformError{"/etc/machine-id: the machine has no identity, so no journal"};
+    return PlatformError{ErrorCode::notFound,
+                         "/etc/machine-id: the machine has no identity, so no journal"};
   const std::string stored = "/var/log/journal/" + machine;
   const int errors[] = {finder.addDirectory(stored),
                         finder.addDirectory("/run/log/journal/" + machine)};
   for (const int error : errors)
     if (error != 0 && error != ENOENT) return storeError(stored, error);
   if (errors[0] != 0 && errors[1] != 0)
-    return PlatformError{stored + ": the machine keeps no journal, here or under /run/log/journal"};
+    return PlatformError{ErrorCode::notFound,
+                         stored + ": the machine keeps no journal, here or under /run/log/journal"};
   return finder.take();
 }
 
@@ -172,7 +174,8 @@ std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::
   struct stat status {};
   if (::stat(path->c_str(), &status) != 0) return storeError(*path, errno);
   if (!S_ISDIR(status.st_mode)) {
-    if (!S_ISREG(status.st_mode)) return PlatformError{*path + ": neither a directory nor a file"};
+    if (!S_ISREG(status.st_mode))
+      return PlatformError{ErrorCode::notAStore, *path + ": neither a directory nor a file"};
     finder.addFile(*path, kindOf(*path).value_or(StoreFileKind::journal));
   } else if (const int error = finder.addDirectory(*path)) {
     return storeError(*path, error);

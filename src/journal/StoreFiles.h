@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
-#include "objects/TesselSupportObjectExtractor.h"
 #include "os/UniqueFd.h"
+#include "platform/Error.h"
 
 namespace tessel {
 

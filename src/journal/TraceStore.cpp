@@ -101,7 +101,8 @@ struct TraceStore::State final : EntryStream {
   const std::vector<EntryMark> marks = tokenizer.marks();
   StoreReport facts;  // its files are complete before the first stream is made
   size_t usableFiles = 0;
-  size_t foreignFiles = 0;  // that journalctl reads for us
+  ErrorCode firstFailure = ErrorCode::notAStore;  // of the first file, where it is not usable
+  size_t foreignFiles = 0;                        // that journalctl reads for us
   SequenceWatch sequences;
   StoreMerger merger;
 };
@@ -137,6 +138,7 @@ void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   if (!file.fd.valid()) {
     report.skipped = whyNotOpened(file.error);
+    if (number == 0) firstFailure = codeOf(file.error);
     return;
   }
   if (file.kind == StoreFileKind::exportStream) {
@@ -152,8 +154,9 @@ void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
 void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   auto opened = readJournalHeader(file.fd.get());
-  if (auto* reason = std::get_if<std::string>(&opened)) {
-    report.skipped = std::move(*reason);
+  if (auto* error = std::get_if<PlatformError>(&opened)) {
+    report.skipped = std::move(error->words);
+    if (number == 0) firstFailure = error->code;
     return;
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
@@ -206,9 +209,10 @@ bool TraceStore::State::outsideRange(const JournalHeader& header) const {
 std::optional<PlatformError> TraceStore::State::failure(const std::string& place) const {
   if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
   if (facts.files.empty())
-    return PlatformError{place + ": holds no *.journal, *.journal~ or *.export file"};
+    return PlatformError{ErrorCode::notAStore,
+                         place + ": holds no *.journal, *.journal~ or *.export file"};
   const FileReport& first = facts.files.front();
-  return PlatformError{first.path + ": " + first.skipped.value_or("not readable")};
+  return PlatformError{firstFailure, first.path + ": " + first.skipped.value_or("not readable")};
 }
 
 TraceStore::TraceStore(std::unique_ptr<State> state) : state_(std::move(state)) {}

@@ -15,7 +15,7 @@
 
 #include "journal/EntryStream.h"
 #include "journal/StoreReport.h"
-#include "objects/TesselSupportObjectExtractor.h"
+#include "platform/Error.h"
 
 namespace tessel {
 

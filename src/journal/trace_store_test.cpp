@@ -32,14 +32,14 @@ struct Reading {
   std::vector<PlainEntry> entries;
   StoreReport report;
   std::string error;
+  ErrorCode code = ErrorCode::failed;
 };
 
 Reading readStore(const std::string& path, TimeRange range = {}) {
   testing::RecordingTokenizer tokenizer;
   StopFlag stop{false};
   auto opened = TraceStore::open(path, range, tokenizer, stop);
-  if (auto* error = std::get_if<PlatformError>(&opened))
-    return {{}, {}, error->localizedDescription};
+  if (auto* error = std::get_if<PlatformError>(&opened)) return {{}, {}, error->words, error->code};
   TraceStore& store = *std::get<0>(opened);
   Reading reading;
   reading.entries = testing::readAll(store.entries(), tokenizer);
@@ -237,6 +237,9 @@ TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
   std::filesystem::create_directory(directory.path("empty"));
   EXPECT_THAT(readStore(directory.path("empty")).error, HasSubstr("holds no *.journal"));
   EXPECT_THAT(readStore("/dev/null").error, HasSubstr("neither a directory nor a file"));
+  EXPECT_EQ(readStore("/nowhere").code, ErrorCode::notFound);
+  EXPECT_EQ(readStore(noise).code, ErrorCode::notAStore);
+  EXPECT_EQ(readStore(directory.path("empty")).code, ErrorCode::notAStore);
 }
 
 TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {

@@ -19,14 +19,10 @@
 #include <string>
 
 #include "objects/TesselObject.h"
+#include "platform/Error.h"
 #include "platform/System.h"
 
 namespace tessel {
-
-// An error of the outside, in words.
-struct PlatformError {
-  std::string localizedDescription;
-};
 
 using IntervalCallback = std::function<bool(const std::shared_ptr<const TesselInterval>&)>;
 using AnimationIntervalCallback =

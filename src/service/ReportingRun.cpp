@@ -123,7 +123,7 @@ std::optional<std::string> ReportingRun::extract(TesselSupportObjectExtractor& e
                                                  Date startDate, Date endDate) {
   std::optional<PlatformError> error;
   if (extractor.processLogArchiveWithPath(std::nullopt, startDate, endDate, error)) return {};
-  std::string description = error ? error->localizedDescription : "Unknown error";
+  std::string description = error ? error->words : "Unknown error";
   tesselReporterLog().debug("Failed to process tessel data due to error: %@", description);
   return description;
 }

@@ -165,7 +165,7 @@ TEST_F(ReportingRunTest, AMarkerThatIsGoneIsNotClearedAndOneThatIsThereIsNotMade
 }
 
 TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
-  extractor->failure = PlatformError{"/store: no such directory"};
+  extractor->failure = PlatformError{ErrorCode::notFound, "/store: no such directory"};
   extractor->eventCount = 7;
   perform();
   EXPECT_EQ(log.count("Failed to process tessel data due to error: /store: no such directory"), 1u);

@@ -88,7 +88,7 @@ int compare(const std::string& path, bool withOthers) {
   const StopFlag stop{false};
   auto opened = TraceStore::open(path, {}, tokenizer, stop);
   if (const auto* error = std::get_if<PlatformError>(&opened)) {
-    std::cout << error->localizedDescription << "\n";
+    std::cout << error->words << "\n";
     return 2;
   }
   TraceStore& store = *std::get<0>(opened);

@@ -276,7 +276,7 @@ int runCompare(const CompareOptions& options) {
   const bool samePeriod = a->period.start == b->period.start && a->period.end == b->period.end;
   Comparison comparison;
   (samePeriod ? compareJudges : comparePeriods)(settings, *reading, comparison);
-  if (comparison.error) return failToRead(comparison.error->localizedDescription, reading->store);
+  if (comparison.error) return failToRead(comparison.error->words, reading->store);
   print(options.json ? comparisonJson(comparison) : comparisonText(comparison, options));
   std::fflush(stdout);
   return warnOfUnreadFiles(comparison.store, reading->store, kDone);

@@ -212,7 +212,7 @@ class ExplainRun {
 
   int follow() {
     const auto error = run_.follow(SystemClock().now(), [] { std::fflush(stdout); });
-    return error ? failToRead(error->localizedDescription, reading_.store) : kDone;
+    return error ? failToRead(error->words, reading_.store) : kDone;
   }
 
   int readOnce() {
@@ -220,7 +220,7 @@ class ExplainRun {
     const auto error = run_.read(reading_.period,
                                  [&](double part, uint64_t entries) { bar.update(part, entries); });
     bar.clear();
-    if (error) return failToRead(error->localizedDescription, reading_.store);
+    if (error) return failToRead(error->words, reading_.store);
     if (options_.summary) {
       print(options_.json ? summaryJson(tally_, run_.report()) + "\n"
                           : summaryText(tally_, run_.report(), terminal_));

@@ -109,9 +109,9 @@ std::optional<Failure> record(const RecordOptions& options, const std::string& k
     error = appendToExportFile(*options.store, std::get<RecordOrigin>(origin), list);
   } else {
     error = sendToJournal(list);
-    if (error) error->localizedDescription += " (--store DIR records without a journal)";
+    if (error) error->words += " (--store DIR records without a journal)";
   }
-  if (error) return Failure{kNoAccess, error->localizedDescription};
+  if (error) return Failure{kNoAccess, error->words};
   return std::nullopt;
 }
 

@@ -50,7 +50,7 @@ int makeReport(const ReportOptions& options, const Reading& reading, ReportFacts
   const auto error =
       run.read(reading.period, [&](double part, uint64_t entries) { bar.update(part, entries); });
   bar.clear();
-  if (error) return failToRead(error->localizedDescription, reading.store);
+  if (error) return failToRead(error->words, reading.store);
   facts.store = reading.store.value_or("the journal of this machine");
   facts.platform = nameForPlatform(reading.machine.platform);
   facts.internal = reading.machine.internal;

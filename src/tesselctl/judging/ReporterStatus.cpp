@@ -34,7 +34,7 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   auto opened = TraceStore::open(store, TimeRange{}, table, stop);
   JournalFacts facts;
   if (const auto* error = std::get_if<PlatformError>(&opened)) {
-    facts.failure = error->localizedDescription;
+    facts.failure = error->words;
     return facts;
   }
   auto& trace = *std::get<std::unique_ptr<TraceStore>>(opened);
