@@ -107,7 +107,7 @@ class ForwarderTest : public ::testing::Test {
   ForwarderState state_{directory_.path()};
 };
 
-TEST_F(ForwarderTest, WhatIsTakenLeavesTheSpoolAndItsSpaceIsGivenBack) {
+TEST_F(ForwarderTest, DeliveredRowsGiveTheirSpaceBack) {
   send(20);
   EXPECT_EQ(deliver(), ForwarderOutcome::delivered);
   EXPECT_THAT(collector_.bodies, SizeIs(3));
@@ -121,7 +121,7 @@ TEST_F(ForwarderTest, WhatIsTakenLeavesTheSpoolAndItsSpaceIsGivenBack) {
   EXPECT_TRUE(collector_.bodies.at(0).starts_with("21{")) << "row numbers are never used again";
 }
 
-TEST_F(ForwarderTest, RefusedRecordsAreFoundAndSetAsideAndTheOthersArriveOnceInOrder) {
+TEST_F(ForwarderTest, OnlyRefusedRecordsAreSetAside) {
   for (const std::vector<int>& bad : {std::vector{1}, {8}, {3, 4}, {1, 5, 8, 12}, {2, 3, 9}}) {
     const int64_t setAsideBefore = collector_.bodies.empty() ? 0 : setAside();
     collector_.accepted.clear();
@@ -137,7 +137,7 @@ TEST_F(ForwarderTest, RefusedRecordsAreFoundAndSetAsideAndTheOthersArriveOnceInO
   }
 }
 
-TEST_F(ForwarderTest, ACollectorThatRefusesRecordAfterRecordIsHeldUp) {
+TEST_F(ForwarderTest, RefusalsInARowHoldEverythingUp) {
   send(12);
   refuse({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12}, 500);
   EXPECT_EQ(deliver(), ForwarderOutcome::held);
@@ -145,7 +145,7 @@ TEST_F(ForwarderTest, ACollectorThatRefusesRecordAfterRecordIsHeldUp) {
   EXPECT_EQ(waiting(), 8);
 }
 
-TEST_F(ForwarderTest, WaitsGrowUntilItGivesUpAndTheSameIsSentEachTime) {
+TEST_F(ForwarderTest, ARetrySendsTheSameAfterALongerWait) {
   send(3);
   collector_.status = [](const std::string&) { return 503; };
   EXPECT_EQ(deliver(), ForwarderOutcome::unreachable);
@@ -179,7 +179,7 @@ TEST_F(ForwarderTest, TheRateHoldsForEveryRequest) {
   EXPECT_THAT(seconds, ElementsAre(0, 2, 2)) << "eight records each, but for the first";
 }
 
-TEST_F(ForwarderTest, WhatIsSetAsideIsLimitedAndTheOldestGoesFirst) {
+TEST_F(ForwarderTest, TheOldestSetAsideGoesFirst) {
   ForwarderState state(directory_.path(), 2);
   send(3);
   ASSERT_TRUE(state.open().ok());
@@ -194,7 +194,7 @@ TEST_F(ForwarderTest, WhatIsSetAsideIsLimitedAndTheOldestGoesFirst) {
   EXPECT_EQ(waiting(), 2);
 }
 
-TEST_F(ForwarderTest, TheServiceCanSendWhileABatchIsOnItsWay) {
+TEST_F(ForwarderTest, SendingGoesOnDuringARequest) {
   send(8);
   collector_.status = [this](const std::string&) {
     if (collector_.bodies.size() == 1) send(3);

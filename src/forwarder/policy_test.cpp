@@ -66,7 +66,7 @@ TEST(PolicyTest, WordsOfACollectorAreFitForATerminal) {
   EXPECT_EQ(answerWords(answer), "400");
 }
 
-TEST(PolicyTest, WaitsDoubleUpToAMostAndHalfOfEachIsChance) {
+TEST(PolicyTest, WaitsDoubleAndHalfIsChance) {
   const Backoff backoff(seconds{5}, seconds{300});
   const struct {
     uint32_t failures;

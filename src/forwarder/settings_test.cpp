@@ -31,7 +31,7 @@ ForwarderSettings settingsOf(Environment environment) {
                                                            : ForwarderSettings{};
 }
 
-TEST(ForwarderSettingsTest, EndpointsAndTheVariableThatComesFirst) {
+TEST(ForwarderSettingsTest, TheLogsEndpointComesFirst) {
   const struct {
     Environment environment;
     const char* url;
@@ -49,7 +49,7 @@ TEST(ForwarderSettingsTest, EndpointsAndTheVariableThatComesFirst) {
   for (const auto& c : cases) EXPECT_EQ(settingsOf(c.environment).url, c.url);
 }
 
-TEST(ForwarderSettingsTest, HeadersArePercentDecodedAndOwnVariablesGoFirst) {
+TEST(ForwarderSettingsTest, HeadersArePercentDecoded) {
   EXPECT_THAT(settingsOf({{"OTEL_EXPORTER_OTLP_HEADERS", " a = b%20c , d=e=f,,g="}}).headers,
               ElementsAre("a: b c", "d: e=f", "g: "));
   const ForwarderSettings settings = settingsOf({{"OTEL_EXPORTER_OTLP_TIMEOUT", "1"},
@@ -66,7 +66,7 @@ TEST(ForwarderSettingsTest, HeadersArePercentDecodedAndOwnVariablesGoFirst) {
   EXPECT_EQ(settingsOf({}).recordsPerSecond, 100u);
 }
 
-TEST(ForwarderSettingsTest, WhatMakesNoSenseIsNamedAndSecretsAreNot) {
+TEST(ForwarderSettingsTest, ErrorsNameNoSecrets) {
   const struct {
     const char* name;
     const char* value;

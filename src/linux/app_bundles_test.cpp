@@ -39,7 +39,7 @@ TEST(AppBundlesTest, TheOneMetadataFileNamesTheBundle) {
   EXPECT_EQ(AppBundles().bundleIdentifier("/nowhere/Clock.AppDir"), std::nullopt);
 }
 
-TEST(AppBundlesTest, OnlyAWellFormedComponentWithAnIdIsMetadata) {
+TEST(AppBundlesTest, MetadataIsWellFormedAndHasAnId) {
   const std::string deep(100'000, '<');
   const struct {
     std::string xml;
@@ -86,7 +86,7 @@ TEST(AppBundlesTest, MetadataMayTakeOneMebibyte) {
             std::nullopt);
 }
 
-TEST(AppBundlesTest, WithoutMetadataTheOneDesktopFileAtTheRootNamesTheBundle) {
+TEST(AppBundlesTest, ALoneDesktopFileNamesTheBundle) {
   const struct {
     const char* file;
     std::optional<std::string> identifier;
@@ -109,7 +109,7 @@ TEST(AppBundlesTest, WithoutMetadataTheOneDesktopFileAtTheRootNamesTheBundle) {
             std::nullopt);
 }
 
-TEST(AppBundlesTest, LinksToFilesAreFollowedAndNothingElseIsOpened) {
+TEST(AppBundlesTest, OnlyFilesAndLinksToThemAreOpened) {
   const TemporaryDirectory bundle;
   bundle.write("usr/share/applications/clock", "");
   std::filesystem::create_symlink("usr/share/applications/clock",

@@ -26,7 +26,7 @@ using testing::TemporaryDirectory;
 
 const Date kNoon{seconds{1'795'000'000}};
 
-TEST(WaitForRunTest, NoWaitExceedsTheIntervalHoweverTheWallClockStands) {
+TEST(WaitForRunTest, NoWaitExceedsTheInterval) {
   const struct {
     const char* what;
     std::optional<Date> lastRun;
@@ -63,7 +63,7 @@ class StateDirectoryTest : public ::testing::Test {
   StateDirectory state_ = opened(temporary_.path("deep/state"));
 };
 
-TEST_F(StateDirectoryTest, IsMadeForItsOwnerAndGroupAndKeptWhenItIsThere) {
+TEST_F(StateDirectoryTest, IsMadeForOwnerAndGroup) {
   struct stat facts {};
   ASSERT_EQ(::stat(state_.path().c_str(), &facts), 0);
   EXPECT_EQ(facts.st_mode & 07777 & ~0750u, 0u);
@@ -73,7 +73,7 @@ TEST_F(StateDirectoryTest, IsMadeForItsOwnerAndGroupAndKeptWhenItIsThere) {
   EXPECT_EQ(opened(state_.path() + "/").lastRun(), kNoon);
 }
 
-TEST_F(StateDirectoryTest, AnUnusableOneIsNamedWithTheReason) {
+TEST_F(StateDirectoryTest, AnUnusableOneHasItsReason) {
   const auto errorOf = [](const std::string& path) {
     const auto result = StateDirectory::open(path);
     return std::holds_alternative<std::string>(result) ? std::get<std::string>(result) : "opened";
@@ -92,7 +92,7 @@ TEST_F(StateDirectoryTest, OneHolderOfTheLockAtATime) {
   EXPECT_TRUE(opened(state_.path()).waitForLock());
 }
 
-TEST_F(StateDirectoryTest, TheRecordIsReplacedAsAWholeAndNonsenseIsNone) {
+TEST_F(StateDirectoryTest, TheRecordIsReplacedAsAWhole) {
   EXPECT_EQ(state_.lastRun(), std::nullopt);
   EXPECT_EQ(state_.recordRun(kNoon - hours{24}), std::nullopt);
   EXPECT_EQ(state_.recordRun(kNoon), std::nullopt);
@@ -134,7 +134,7 @@ class ActivityDeliveriesTest : public StateDirectoryTest {
   std::shared_ptr<Activity> latest_;
 };
 
-TEST_F(ActivityDeliveriesTest, WithoutAnIntervalOneRunFollowsTheCheckInAtOnce) {
+TEST_F(ActivityDeliveriesTest, OneRunFollowsTheCheckIn) {
   state_.recordRun(clock_.now());
   ActivityDeliveries once = deliveries({});
   once.deliverCheckIn();
@@ -143,7 +143,7 @@ TEST_F(ActivityDeliveriesTest, WithoutAnIntervalOneRunFollowsTheCheckInAtOnce) {
   EXPECT_TRUE(clock_.waits.empty());
 }
 
-TEST_F(ActivityDeliveriesTest, WithAnIntervalARunComesThatLongAfterTheLastOneBegan) {
+TEST_F(ActivityDeliveriesTest, RunsAreAnIntervalApart) {
   state_.recordRun(clock_.now() - hours{23});
   const Date start = clock_.now();
   handle_ = [&](Activity&) { clock_.advance(std::chrono::minutes{10}); };
@@ -154,7 +154,7 @@ TEST_F(ActivityDeliveriesTest, WithAnIntervalARunComesThatLongAfterTheLastOneBeg
   EXPECT_EQ(state_.lastRun(), start + hours{25});
 }
 
-TEST_F(ActivityDeliveriesTest, ARunOfAnotherProcessDuringTheWaitStartsTheWaitAgain) {
+TEST_F(ActivityDeliveriesTest, AnothersRunRestartsTheWait) {
   state_.recordRun(clock_.now());
   const Date otherRun = clock_.now() + hours{20};
   clock_.whileWaiting = [&] {
@@ -165,7 +165,7 @@ TEST_F(ActivityDeliveriesTest, ARunOfAnotherProcessDuringTheWaitStartsTheWaitAga
   EXPECT_THAT(begins_, ElementsAre(otherRun + hours{24}));
 }
 
-TEST_F(ActivityDeliveriesTest, ARunThatCannotBeRecordedIsSaidAndNotRepeatedAtOnce) {
+TEST_F(ActivityDeliveriesTest, AnUnrecordedRunIsNotRedone) {
   const testing::RecordingLog log;
   std::filesystem::create_directory(state_.path() + "/scheduler-last-run.new");
   ActivityDeliveries hourly = deliveries({hours{1}, seconds{900}});
@@ -176,7 +176,7 @@ TEST_F(ActivityDeliveriesTest, ARunThatCannotBeRecordedIsSaidAndNotRepeatedAtOnc
   EXPECT_EQ(log.lines().size(), 2u);
 }
 
-TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgainAfterTheRetryTimeAndNotRecorded) {
+TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgain) {
   wantDeferral();
   handle_ = [](Activity& activity) {
     if (!activity.shouldDefer()) return;
@@ -193,7 +193,7 @@ TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgainAfterTheRetryTimeAndNot
   EXPECT_EQ(state_.lastRun(), start + seconds{900});
 }
 
-TEST_F(ActivityDeliveriesTest, OnlyDeferIsTakenOnlyOnceAndOnlyDuringARun) {
+TEST_F(ActivityDeliveriesTest, DeferIsTakenOnceDuringARun) {
   handle_ = [](Activity& activity) {
     for (const int64_t state : {0, 1, 2, 4, 5, -1}) EXPECT_FALSE(activity.setState(state)) << state;
     const bool isRun = activity.state() == kActivityStateRun;
@@ -230,7 +230,7 @@ struct SignallingStatus final : ServiceStatus {
   Semaphore waitsForOther{0};
 };
 
-TEST_F(ActivityDeliveriesTest, ASecondProcessWithAnIntervalDoesNotRepeatTheRunOfTheFirst) {
+TEST_F(ActivityDeliveriesTest, TwoProcessesRunOnce) {
   SignallingStatus status;
   std::optional<RunLock> first = state_.tryLock();
   const Date start = clock_.now();
@@ -245,7 +245,7 @@ TEST_F(ActivityDeliveriesTest, ASecondProcessWithAnIntervalDoesNotRepeatTheRunOf
   EXPECT_THAT(begins_, ElementsAre(start + hours{24}));
 }
 
-TEST_F(ActivityDeliveriesTest, TheProcessMayNotEndBeforeTheLastDeliveryIsOver) {
+TEST_F(ActivityDeliveriesTest, ADeliveryHoldsTheProcess) {
   ServiceManager manager(clock_, [](const std::string&) {}, {});
   ServiceRuntime runtime(manager);
   BackgroundScheduler scheduler({}, state_, conditions_, runtime, manager, clock_);

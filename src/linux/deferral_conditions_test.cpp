@@ -39,11 +39,11 @@ class DeferralConditionsTest : public ::testing::Test {
   TemporaryDirectory machine_;
 };
 
-TEST_F(DeferralConditionsTest, WhatTheMachineLacksNeverDefers) {
+TEST_F(DeferralConditionsTest, AMissingSourceNeverDefers) {
   EXPECT_FALSE(defers({true, true, true}));
 }
 
-TEST_F(DeferralConditionsTest, EachSourceDefersOnlyWhereItIsEnabled) {
+TEST_F(DeferralConditionsTest, ADisabledSourceNeverDefers) {
   machine_.write("defer", "");
   plug("BAT0", {});
   machine_.write("cpu", "some avg10=99.00 avg60=0.00 avg300=0.00 total=1\n");
@@ -58,7 +58,7 @@ TEST_F(DeferralConditionsTest, ALinkToNowhereIsADeferFile) {
   EXPECT_TRUE(defers({true, false, false}));
 }
 
-TEST_F(DeferralConditionsTest, ABatteryDefersWhenItIsLowAndDischarging) {
+TEST_F(DeferralConditionsTest, ALowDrainingBatteryDefers) {
   const struct {
     Supply supply;
     bool defers;
@@ -75,7 +75,7 @@ TEST_F(DeferralConditionsTest, ABatteryDefersWhenItIsLowAndDischarging) {
   }
 }
 
-TEST_F(DeferralConditionsTest, OnlyBatteriesThatFeedTheMachineCountAndAllOfThemMustBeLow) {
+TEST_F(DeferralConditionsTest, AllOwnBatteriesMustBeLow) {
   plug("BAT0", {"Battery", "Discharging", "10"});
   machine_.write("power/BAT1/present", "0\n");
   plug("BAT1", {"Battery", "Unknown", "90"});
@@ -90,7 +90,7 @@ TEST_F(DeferralConditionsTest, OnlyBatteriesThatFeedTheMachineCountAndAllOfThemM
   EXPECT_FALSE(battery()) << "only the mouse is low";
 }
 
-TEST_F(DeferralConditionsTest, PressureDefersAboveEightyPercentOfTheLastTenSeconds) {
+TEST_F(DeferralConditionsTest, PressureAboveEightyDefers) {
   const struct {
     const char* text;
     bool defers;

@@ -50,7 +50,7 @@ TEST(LaunchConfigurationTest, EveryVariableIsRead) {
   EXPECT_EQ(configurationOf({{"TESSEL_DEFER_ON", ""}}).deferOn, DeferSources{});
 }
 
-TEST(LaunchConfigurationTest, TheManagersDirectoriesComeBeforeTheDefaultsAndAfterOurOwnVariables) {
+TEST(LaunchConfigurationTest, OwnDirectoriesComeFirst) {
   const Variables managed{{"STATE_DIRECTORY", "/managed/state:/managed/more"},
                           {"CONFIGURATION_DIRECTORY", ""}};
   EXPECT_EQ(configurationOf(managed).stateDirectory, "/managed/state");
@@ -60,7 +60,7 @@ TEST(LaunchConfigurationTest, TheManagersDirectoriesComeBeforeTheDefaultsAndAfte
   EXPECT_EQ(configurationOf(both).stateDirectory, "/ours");
 }
 
-TEST(LaunchConfigurationTest, ValuesThatMakeNoSenseAreNamedOnOneLine) {
+TEST(LaunchConfigurationTest, NonsenseIsNamedOnOneLine) {
   const struct {
     const char* variable;
     const char* value;
@@ -90,7 +90,7 @@ TEST(LaunchConfigurationTest, ValuesThatMakeNoSenseAreNamedOnOneLine) {
   }
 }
 
-TEST(LaunchConfigurationTest, AValueCannotBreakItsLineOrReachTheTerminal) {
+TEST(LaunchConfigurationTest, AValueCannotBreakItsLine) {
   const auto result = readFrom({{"TESSEL_LOG", "a\nb\x1b[2J" + std::string(100'000, 'x')}});
   const std::string line = std::get<LaunchError>(result).line();
   EXPECT_THAT(line, ::testing::HasSubstr("\"a\\x0ab\\x1b[2Jxxx"));

@@ -44,7 +44,7 @@ TEST_F(LocalFilesTest, ALinkCountsAsWhatItIs) {
   EXPECT_EQ(existence(), std::pair(true, true));
 }
 
-TEST_F(LocalFilesTest, AFileIsCreatedEmptyAndOnlyWhereNothingIs) {
+TEST_F(LocalFilesTest, AFileIsMadeOnlyWhereNothingIs) {
   EXPECT_TRUE(files_.createFile(path_));
   EXPECT_EQ(fs::file_size(path_), 0u);
   directory_.write("marker", "kept");
@@ -57,7 +57,7 @@ TEST_F(LocalFilesTest, AFileIsCreatedEmptyAndOnlyWhereNothingIs) {
   EXPECT_FALSE(files_.createFile(directory_.path("missing/marker")));
 }
 
-TEST_F(LocalFilesTest, RemovalTakesATreeAndFollowsNoLinkOutOfIt) {
+TEST_F(LocalFilesTest, RemovalFollowsNoLink) {
   directory_.write("outside/file", "kept");
   directory_.write("marker/a/b/file", "");
   directory_.write("marker/file", "");
@@ -82,7 +82,7 @@ TEST_F(LocalFilesTest, AFailedRemovalSaysWhatAndWhy) {
             directory_.path("missing") + ": No such file or directory");
 }
 
-TEST_F(LocalFilesTest, ADirectoryThatIsNestedTooDeeplyFailsAsAWhole) {
+TEST_F(LocalFilesTest, RemovalEndsAtItsDepthLimit) {
   UniqueFd level(::open(directory_.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   const char* name = "marker";
   for (int depth = 0; depth <= LocalFiles::kMaxRemovalDepth; ++depth) {
@@ -111,7 +111,7 @@ TEST_F(LocalFilesTest, ADirectoryThatIsNestedTooDeeplyFailsAsAWhole) {
   _exit(below && above && directory.read("outside/file") == "kept" ? 0 : 1);
 }
 
-TEST_F(LocalFilesTest, RemovalCrossesNoMountOfTheSameFileSystemEither) {
+TEST_F(LocalFilesTest, RemovalCrossesNoMount) {
   if (::geteuid() != 0) GTEST_SKIP() << "mounting needs root";
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   directory_.write("outside/file", "kept");

@@ -24,7 +24,7 @@ std::string linesOf(LogLevel level, std::string_view text, std::string_view prog
   return directory.read("log");
 }
 
-TEST(StderrLogTest, EachMessageIsOneLineAndTextOfStrangersStartsNoneAndReachesNoTerminal) {
+TEST(StderrLogTest, ForeignTextCannotStartALine) {
   const struct {
     std::string_view text;
     const char* line;
@@ -45,7 +45,7 @@ TEST(StderrLogTest, EachMessageIsOneLineAndTextOfStrangersStartsNoneAndReachesNo
   EXPECT_EQ(linesOf(LogLevel::error, "a\nb", "program"), "program: error: a\n    b\n");
 }
 
-TEST(JournalLogTest, AnEntryKeepsTheTextAndCannotLookLikeATracePoint) {
+TEST(JournalLogTest, AnEntryIsNeverATracePoint) {
   const auto fields = journalFields(LogLevel::debug, "com.vantor.TesselSupport", "tessel_reporter",
                                     "Checking in\nTESSEL_KIND=event\n");
   EXPECT_THAT(fields, ::testing::UnorderedElementsAre(

@@ -40,7 +40,7 @@ TEST_F(ServiceManagerTest, StatusIsOneLineAndNotRepeated) {
               ElementsAre("READY=1", "STATUS=reading", "STATUS=two lines", "STOPPING=1"));
 }
 
-TEST_F(ServiceManagerTest, ProgressFeedsTheWatchdogFourTimesPerPeriod) {
+TEST_F(ServiceManagerTest, ProgressFeedsFourTimesAPeriod) {
   ServiceManager manager(clock_, remember(), std::chrono::seconds{8});
   for (int millisecond = 0; millisecond < 8000; ++millisecond) {
     manager.progress();
@@ -56,7 +56,7 @@ class ServiceRuntimeTest : public ::testing::Test {
   ServiceRuntime runtime_{manager_};
 };
 
-TEST_F(ServiceRuntimeTest, TheProcessMayEndOnlyWhenAskedToAndNothingIsOpenOrPending) {
+TEST_F(ServiceRuntimeTest, ATransactionHoldsTheProcess) {
   runtime_.openTransaction("before").reset();
   EXPECT_FALSE(runtime_.mayExit()) << "nobody asked";
   auto outer = runtime_.openTransaction("outer");
@@ -81,7 +81,7 @@ class ProcessEndTest : public ServiceRuntimeTest {
   ProcessEndTest() { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
 
-TEST_F(ProcessEndTest, TheMainLoopEndsTheProcessWhenTheLastTransactionCloses) {
+TEST_F(ProcessEndTest, TheLastTransactionEndsTheLoop) {
   EXPECT_EXIT(
       {
         WorkerQueue queue("test");
@@ -96,7 +96,7 @@ TEST_F(ProcessEndTest, TheMainLoopEndsTheProcessWhenTheLastTransactionCloses) {
       ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(ProcessEndTest, AnInterruptBeforeTheSourceIsResumedIsDeliveredOnceItIs) {
+TEST_F(ProcessEndTest, AnEarlyInterruptIsDelivered) {
   EXPECT_EXIT(
       {
         prepareProcess();
@@ -115,7 +115,7 @@ TEST_F(ProcessEndTest, AnInterruptBeforeTheSourceIsResumedIsDeliveredOnceItIs) {
       ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(ProcessEndTest, AnInterruptThatIsIgnoredByInheritanceStillEndsTheProcess) {
+TEST_F(ProcessEndTest, AnIgnoredInterruptStillEndsIt) {
   EXPECT_EXIT(
       {
         std::signal(SIGINT, SIG_IGN);
@@ -130,7 +130,7 @@ TEST_F(ProcessEndTest, AnInterruptThatIsIgnoredByInheritanceStillEndsTheProcess)
       ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(ProcessEndTest, ClosedStandardDescriptorsAreTakenBeforeAFileTakesThem) {
+TEST_F(ProcessEndTest, ClosedDescriptorsAreFilled) {
   EXPECT_EXIT(
       {
         ::close(0);

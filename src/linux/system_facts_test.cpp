@@ -40,7 +40,7 @@ TEST(MountTableTest, TheTopmostMountAtTheRootCounts) {
   EXPECT_EQ(MountTable(directory.path("none")).rootFilesystemTypeName(), std::nullopt);
 }
 
-TEST(BuildVariantTest, InternalIsWhatTheLastVariantIdSays) {
+TEST(BuildVariantTest, TheLastVariantIdCounts) {
   const struct {
     const char* release;
     bool internal;
@@ -75,7 +75,7 @@ TEST(BuildVariantTest, TheFileIsReadOnce) {
   EXPECT_TRUE(variant.hasInternalDiagnostics("com.vantor.tessel"));
 }
 
-TEST(IcuDatesTest, ShortDateAndMediumTimeInLocaleAndTimeZone) {
+TEST(IcuDatesTest, FormatsByLocaleAndTimeZone) {
   const Date date{std::chrono::seconds{1'795'000'000} + std::chrono::microseconds{999'999}};
   EXPECT_EQ(IcuDates("de_DE.UTF-8", "UTC").format(date), "18.11.26, 11:06:40");
   EXPECT_EQ(IcuDates("de_DE.UTF-8", "Asia/Kolkata").format(date), "18.11.26, 16:36:40");

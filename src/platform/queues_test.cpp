@@ -11,7 +11,7 @@
 namespace tessel {
 namespace {
 
-TEST(WorkerQueueTest, RunsOneAtATimeInOrderOfSubmissionWhicheverThreadSubmits) {
+TEST(WorkerQueueTest, RunsOneAtATimeInOrder) {
   constexpr size_t kThreads = 4;
   constexpr int kEach = 500;
   WorkerQueue queue("test");
@@ -32,7 +32,7 @@ TEST(WorkerQueueTest, RunsOneAtATimeInOrderOfSubmissionWhicheverThreadSubmits) {
   for (const auto& order : orders) EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
 }
 
-TEST(WorkerQueueTest, RunsWhatItHoldsAfterItsLastReferenceWentAndAfterItsThreadLeft) {
+TEST(WorkerQueueTest, ADroppedQueueRunsWhatItHolds) {
   const auto done = std::make_shared<Semaphore>(0);
   {
     WorkerQueue queue("test");
@@ -41,7 +41,7 @@ TEST(WorkerQueueTest, RunsWhatItHoldsAfterItsLastReferenceWentAndAfterItsThreadL
   EXPECT_TRUE(done->waitFor(std::chrono::seconds(30)));
 }
 
-TEST(RepeatingTimerTest, FiresAtOnceAndGoesOnAfterItsOwnerLetGo) {
+TEST(RepeatingTimerTest, FiresAtOnceAndOutlivesItsOwner) {
   WorkerQueueFactory factory;
   const auto fired = std::make_shared<Semaphore>(0);
   {

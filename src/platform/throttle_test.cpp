@@ -22,7 +22,7 @@ class ThrottleTest : public ::testing::Test {
   Throttle throttle{clock};
 };
 
-TEST_F(ThrottleTest, TheTenthStepSleepsForTheRestOfTheQuantum) {
+TEST_F(ThrottleTest, TheTenthStepSleepsToTheQuantumsEnd) {
   steps(9);
   clock.advance(nanoseconds{50'000'100});
   EXPECT_TRUE(clock.sleeps.empty());
@@ -37,7 +37,7 @@ TEST_F(ThrottleTest, TheTenthStepSleepsForTheRestOfTheQuantum) {
           "Sleeping for 74999 us"}));
 }
 
-TEST_F(ThrottleTest, ALongQuantumIsClosedWithoutSleepAndTheNextStartsAtItsEnd) {
+TEST_F(ThrottleTest, ALongQuantumEndsWithoutSleep) {
   steps(9);
   clock.advance(nanoseconds{125'000'000});
   steps(1);

@@ -11,7 +11,7 @@ const ConfigurationFile kNone{false, {}};
 const ConfigurationFile kUnreadable{true, {}};
 ConfigurationFile holding(const char* text) { return {true, text}; }
 
-TEST(ConfigurationChangesTest, TellsConfigurationsAtOnceAndAbsenceWhenItLasts) {
+TEST(ConfigurationChangesTest, AbsenceIsToldWhenItLasts) {
   const struct {
     const char* what;
     std::vector<ConfigurationFile> looks;

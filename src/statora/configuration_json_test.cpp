@@ -7,7 +7,7 @@
 namespace tessel {
 namespace {
 
-TEST(ConfigurationJsonTest, NumbersKeepTheirKindAndBooleansAreNumbers) {
+TEST(ConfigurationJsonTest, NumbersKeepTheirKind) {
   const struct {
     const char* text;
     Number number;
@@ -29,7 +29,7 @@ TEST(ConfigurationJsonTest, NumbersKeepTheirKindAndBooleansAreNumbers) {
   }
 }
 
-TEST(ConfigurationJsonTest, StructureIsKeptAndTheLastOfEqualKeysCounts) {
+TEST(ConfigurationJsonTest, TheLastOfEqualKeysCounts) {
   const auto configuration =
       parseConfiguration("\n{\"a\":[1,null,\"\\u00fc\"],\"b\":{\"a\":2},\"a\":[[],{}, \"x\"]}\n");
   ASSERT_NE(configuration, nullptr);
@@ -44,7 +44,7 @@ TEST(ConfigurationJsonTest, StructureIsKeptAndTheLastOfEqualKeysCounts) {
   EXPECT_EQ(std::get<Number>(inner.at("a").value), Number{int64_t{2}});
 }
 
-TEST(ConfigurationJsonTest, AnythingElseIsNoConfiguration) {
+TEST(ConfigurationJsonTest, NonsenseIsNoConfiguration) {
   const std::string deep(kMaxConfigurationDepth + 1, '[');
   const std::string endless(1 << 20, '[');
   for (const std::string& text :

@@ -79,7 +79,7 @@ class FileConfigurationServiceTest : public ::testing::Test {
   std::shared_ptr<ConfigurationObserver> observer_;
 };
 
-TEST_F(FileConfigurationServiceTest, CallsOnceAtTheStartAndAgainOnEachChange) {
+TEST_F(FileConfigurationServiceTest, CallsOnEachChange) {
   directory_.write(kFile, R"({"v":"one"})");
   observe();
   EXPECT_EQ(delegate_->next(), "one");
@@ -100,7 +100,7 @@ TEST_F(FileConfigurationServiceTest, CallsOnceAtTheStartAndAgainOnEachChange) {
   EXPECT_EQ(delegate_->next(kQuiet), "none") << "nothing changed";
 }
 
-TEST_F(FileConfigurationServiceTest, NoFileNoCallUntilThereIsOne) {
+TEST_F(FileConfigurationServiceTest, NoCallWithoutAFile) {
   observe(directory_.path("later/still"));
   EXPECT_EQ(delegate_->next(kQuiet), "none");
   std::filesystem::create_directories(directory_.path("later/still"));
@@ -109,7 +109,7 @@ TEST_F(FileConfigurationServiceTest, NoFileNoCallUntilThereIsOne) {
   EXPECT_EQ(delegate_->next(), "made");
 }
 
-TEST_F(FileConfigurationServiceTest, AReplacedDirectoryAndReplacedLinksAreFollowed) {
+TEST_F(FileConfigurationServiceTest, ReplacedLinksAreSeen) {
   for (const char* name : {"a", "b", "c"}) {
     std::filesystem::create_directory(directory_.path(name));
     directory_.write(std::string(name) + "/" + kFile, std::string(R"({"v":")") + name + "\"}");
@@ -131,7 +131,7 @@ TEST_F(FileConfigurationServiceTest, AReplacedDirectoryAndReplacedLinksAreFollow
   EXPECT_EQ(delegate_->next(), "in c");
 }
 
-TEST_F(FileConfigurationServiceTest, WhatIsNoConfigurationIsAbsent) {
+TEST_F(FileConfigurationServiceTest, NonsenseIsAbsent) {
   const std::string file = directory_.path(kFile);
   const struct {
     const char* what;
@@ -158,7 +158,7 @@ TEST_F(FileConfigurationServiceTest, WhatIsNoConfigurationIsAbsent) {
   }
 }
 
-TEST_F(FileConfigurationServiceTest, ADroppedObserverLeavesNoThreadAndNoDescriptor) {
+TEST_F(FileConfigurationServiceTest, NoThreadIsLeft) {
   const auto entries = [](const char* path) {
     return std::distance(std::filesystem::directory_iterator(path),
                          std::filesystem::directory_iterator());
@@ -183,7 +183,7 @@ TEST_F(FileConfigurationServiceTest, ADroppedObserverLeavesNoThreadAndNoDescript
   EXPECT_LE(entries("/proc/self/task"), 2) << "the main thread and at most the queue's";
 }
 
-TEST_F(FileConfigurationServiceTest, ACallThatIsOnTheQueueOutlivesTheObserver) {
+TEST_F(FileConfigurationServiceTest, AQueuedCallIsMade) {
   directory_.write(kFile, R"({"v":"one"})");
   Semaphore blocked(0);
   queue_->async([&blocked] { blocked.waitFor(kDeadline); });
