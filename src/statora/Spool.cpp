@@ -10,7 +10,6 @@
 #include <ctime>
 #include <filesystem>
 #include <iterator>
-#include <numeric>
 #include <utility>
 
 #include "os/DurableFile.h"
@@ -30,12 +29,6 @@ constexpr const char* kUpgrades[] = {
     "INSERT INTO meta VALUES('spool_id', lower(hex(randomblob(16))));",
 };
 static_assert(std::size(kUpgrades) == kSpoolSchemaVersion);
-
-// SQLite would give the group no leave to write, and the forwarder works as a member of it. Only a
-// file that is new is opened: closing another descriptor of a database drops this process's locks.
-void makeFileForGroup(const std::string& path) {
-  const UniqueFd made(::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0660));
-}
 
 SqliteStatus upgrade(SqliteDatabase& database) {
   if (SqliteStatus begun = database.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
@@ -76,7 +69,6 @@ SqliteStatus prepareSchema(SqliteDatabase& database) {
 
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds) {
-  makeFileForGroup(path);
   makeFile(path);
   SqliteStatus status = database.open(path, SqliteDatabase::Mode::create);
   if (!status.ok()) return status;
@@ -131,10 +123,6 @@ const char* spoolFailureName(SpoolFailure failure) {
   constexpr const char* kNames[kSpoolFailureKinds] = {"limit",   "disk_full", "read_only", "locked",
                                                       "damaged", "version",   "other"};
   return kNames[static_cast<size_t>(failure)];
-}
-
-uint64_t SpoolFigures::failedInAll() const {
-  return std::accumulate(failed.begin(), failed.end(), uint64_t{0});
 }
 
 Spool::Spool(std::string stateDirectory, Clock& clock, uint64_t maxBytes)

@@ -65,8 +65,6 @@ struct SpoolFigures {
   uint64_t stored = 0;
   std::array<uint64_t, kSpoolFailureKinds> failed{};  // by SpoolFailure
   std::vector<std::string> setAside;                  // names that damaged databases were given
-
-  uint64_t failedInAll() const;
 };
 
 class Spool final : public EventSender {
