@@ -12,7 +12,6 @@
 #include <string>
 #include <vector>
 
-#include "filter/DefaultDownsampling.h"
 #include "filter/TesselReporterObjectFilter.h"
 #include "platform/Log.h"
 

@@ -5,7 +5,6 @@
 #include <type_traits>
 #include <utility>
 
-#include "filter/DefaultDownsampling.h"
 #include "platform/Invariant.h"
 #include "whitelist/StringWhitelist.h"
 
@@ -61,7 +60,10 @@ std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::initWith
 
 TesselReporterObjectFilter::TesselReporterObjectFilter(TesselReporterPlatform platform,
                                                        BuildVariant& variant)
-    : platform_(platform), variant_(variant), scnFilter_(defaultFilterForPlatform(platform)) {}
+    : platform_(platform),
+      profile_(profileOf(platform)),
+      variant_(variant),
+      scnFilter_(defaultFilterForPlatform(platform)) {}
 
 bool TesselReporterObjectFilter::shouldReportTesselObject(
     const TesselSupportObject& object, TesselReporterClassification* classificationOut) {
@@ -99,7 +101,7 @@ FilterDecision TesselReporterObjectFilter::decide(const TesselSupportObject& sup
 // The special rule comes before the build variant is asked, so it holds on every build.
 bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& object,
                                                           FilterDecision& decision) const {
-  const bool special = platform_ == TesselReporterPlatform::quarro &&
+  const bool special = profile_.hasPerfLoggingRule &&
                        isPerfLoggingOperation(object.subsystem(), object.category(), object.name());
   if (special && !perfLoggingOperationStringsPass(object.string1Value(), object.string2Value())) {
     failSpecialRule(object, decision);

@@ -18,8 +18,8 @@
 #include "filter/TesselReporterAggregation.h"
 #include "objects/TesselObject.h"
 #include "objects/TesselReporterClassification.h"
-#include "objects/TesselReporterPlatform.h"
 #include "platform/System.h"
+#include "whitelist/PlatformProfile.h"
 
 namespace tessel {
 
@@ -124,6 +124,7 @@ class TesselReporterObjectFilter {
   bool objectPassesDownsampling(const TesselObject& object, FilterDecision& decision) const;
 
   const TesselReporterPlatform platform_;
+  const PlatformProfile& profile_;
   BuildVariant& variant_;
   std::shared_ptr<TRSubsystemCategoryNameFilter> scnFilter_;
   Aggregation allInspected_;

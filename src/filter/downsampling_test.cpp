@@ -7,7 +7,6 @@
 #include <map>
 #include <random>
 
-#include "filter/DefaultDownsampling.h"
 #include "filter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter.h"
 #include "objects/testing/TestObjects.h"
 #include "platform/testing/Fakes.h"
@@ -241,8 +240,8 @@ TEST(DefaultDownsamplingTest, TheTablesHoldTheirRows) {
     EXPECT_EQ(rowFor(TesselReporterPlatform::selvin, path), std::nullopt) << *path.name;
   EXPECT_EQ(rowFor(TesselReporterPlatform::quarro, footprint), Row({0, 503}));
   EXPECT_EQ(rowFor(TesselReporterPlatform::quarro, text), std::nullopt);
-  EXPECT_EQ(defaultSelvinConfiguration().size(), 4u);
-  EXPECT_EQ(defaultQuarroConfiguration().size(), 1u);
+  EXPECT_EQ(defaultConfigurationForPlatform(TesselReporterPlatform::selvin)->size(), 4u);
+  EXPECT_EQ(defaultConfigurationForPlatform(TesselReporterPlatform::quarro)->size(), 1u);
 }
 
 }  // namespace

@@ -4,7 +4,6 @@
 
 #include <vector>
 
-#include "filter/DefaultDownsampling.h"
 #include "filter/TesselReporterObjectFilter.h"
 #include "filter/testing/CountedAllocations.h"
 #include "objects/testing/TestObjects.h"

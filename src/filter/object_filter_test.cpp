@@ -10,7 +10,6 @@
 #include <random>
 #include <set>
 
-#include "filter/DefaultDownsampling.h"
 #include "objects/testing/TestObjects.h"
 #include "platform/testing/Fakes.h"
 

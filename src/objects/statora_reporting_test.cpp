@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include "objects/ProcessIdentity.h"
-#include "objects/TesselReporterPlatform.h"
 #include "objects/testing/TestObjects.h"
 #include "platform/testing/Fakes.h"
 
@@ -130,17 +129,6 @@ TEST(TesselClassTest, AnObjectIsOfItsClassAndOfThoseItDerivesFrom) {
   EXPECT_EQ(answersOf(*makeEvent({})), (Answers{true, true, true, false, false}));
   EXPECT_EQ(answersOf(*makeInterval({})), (Answers{true, true, false, true, false}));
   EXPECT_EQ(answersOf(*makeAnimationInterval({})), (Answers{true, true, false, true, true}));
-}
-
-TEST(TesselReporterPlatformTest, NamesAndCodesBelongTogether) {
-  for (uint64_t code = 0; code <= 5; ++code) {
-    const auto platform = static_cast<TesselReporterPlatform>(code);
-    EXPECT_EQ(platformFromName(SharedString(nameForPlatform(platform))), platform);
-  }
-  EXPECT_EQ(nameForPlatform(currentPlatform()), "Selvin");
-  EXPECT_EQ(nameForPlatform(static_cast<TesselReporterPlatform>(6)), "Unknown");
-  EXPECT_EQ(platformFromName(SharedString("selvin")), TesselReporterPlatform::unknown);
-  EXPECT_EQ(platformFromName({}), TesselReporterPlatform::unknown);
 }
 
 }  // namespace

@@ -1,63 +1,38 @@
 // Rules and sets of the string whitelist.
+//
+// No set is ever destroyed, because a run may still ask while another thread ends the process.
 
 #include "whitelist/StringWhitelist.h"
 
+#include <array>
+#include <atomic>
+#include <mutex>
+
 #include "platform/Log.h"
-#include "whitelist/WhitelistLists.h"
 
 namespace tessel {
 
-namespace {
-
-// The set is never destroyed: a run may still ask while the process exits.
-const StringSet& makeWhitelist(LogFormat<size_t> message, std::initializer_list<StringList> lists) {
-  const auto* set = new StringSet(lists);
-  tesselReporterLog().debug(message, set->size());
-  return *set;
+StringSet::StringSet(std::span<const StringListSource> lists) {
+  for (const StringListSource list : lists) {
+    for (const std::string_view text : list()) add(text);
+  }
 }
 
-const StringSet& quarroWhitelist() {
-  static const StringSet& set =
-      makeWhitelist("Using string whitelist with %lu elements for Quarro platform",
-                    {perfLoggingComponentNames(), perfLoggingActionNames(),
-                     desktopBundleIdentifiers(), fileSystemScanValues(), commonWhitelistValues()});
-  return set;
+void StringSet::add(std::string_view text) {
+  index_.findOrAdd(
+      static_cast<uint32_t>(hashText(text)),
+      [&](uint32_t number) { return texts_[number] == text; },
+      [&] {
+        texts_.push_back(text);
+        return static_cast<uint32_t>(texts_.size() - 1);
+      });
 }
 
-const StringSet& selvinWhitelist() {
-  static const StringSet& set =
-      makeWhitelist("Using string whitelist with %lu elements for Selvin platform",
-                    {launchSourceValues(), cameraValues(), shareActivityTypes(),
-                     extensionBundleIdentifiers(), periodViewValues(), sizeValues(),
-                     mailAccountKindValues(), generationSourceValues(), commonWhitelistValues()});
-  return set;
+bool StringSet::contains(StringRef value) const {
+  if (!value.present()) return false;
+  const auto isValue = [&](uint32_t number) { return texts_[number] == value.text(); };
+  return index_.find(static_cast<uint32_t>(value.hash()), isValue) != FlatIndex::kNone;
 }
-
-const StringSet& darrowWhitelist() {
-  static const StringSet& set = makeWhitelist(
-      "Using string whitelist with %lu elements for Darrow platform", {commonWhitelistValues()});
-  return set;
-}
-
-const StringSet& fennicWhitelist() {
-  static const StringSet& set = makeWhitelist(
-      "Using string whitelist with %lu elements for Fennic platform", {commonWhitelistValues()});
-  return set;
-}
-
-const StringSet& lumetWhitelist() {
-  static const StringSet& set =
-      makeWhitelist("Using string whitelist with %lu elements for Lumet platform", {});
-  return set;
-}
-
-const StringSet& unknownPlatformWhitelist() {
-  static const StringSet& set =
-      makeWhitelist("Using string whitelist with %lu elements for Unknown platform", {});
-  return set;
-}
-
-}  // namespace
 
 bool shouldUseStringWhitelist(BuildVariant& variant) {
   if (variant.hasInternalDiagnostics("com.vantor.tessel")) {
@@ -74,39 +49,44 @@ bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef n
 }
 
 bool perfLoggingOperationStringsPass(StringRef component, StringRef action) {
-  if (!component.present() || !action.present()) return false;
-  return perfLoggingComponentSet().contains(component) && perfLoggingActionSet().contains(action);
+  return component.present() && action.present() && perfLoggingComponentSet().contains(component) &&
+         perfLoggingActionSet().contains(action);
 }
 
 const StringSet& perfLoggingComponentSet() {
-  static const StringSet& set = *new StringSet({perfLoggingComponentNames()});
+  static constexpr StringListSource kLists[] = {perfLoggingComponentNames};
+  static const StringSet& set = *new StringSet(kLists);
   return set;
 }
 
 const StringSet& perfLoggingActionSet() {
-  static const StringSet& set = *new StringSet({perfLoggingActionNames()});
+  static constexpr StringListSource kLists[] = {perfLoggingActionNames};
+  static const StringSet& set = *new StringSet(kLists);
   return set;
 }
 
 const StringSet& stringWhitelistForPlatform(TesselReporterPlatform platform) {
-  switch (platform) {
-    case TesselReporterPlatform::quarro:
-      return quarroWhitelist();
-    case TesselReporterPlatform::selvin:
-      return selvinWhitelist();
-    case TesselReporterPlatform::darrow:
-      return darrowWhitelist();
-    case TesselReporterPlatform::fennic:
-      return fennicWhitelist();
-    case TesselReporterPlatform::lumet: {
-      const StringSet& set = lumetWhitelist();
-      tesselReporterLog().debug("Using string whitelist with %lu elements", set.size());
-      return set;
+  // Each set on its own and only when it is asked for, because its size is logged at that moment.
+  static std::array<std::atomic<const StringSet*>, kPlatformProfiles> sets;
+  static std::mutex building;
+
+  const PlatformProfile& profile = profileOf(platform);
+  std::atomic<const StringSet*>& built = sets[static_cast<size_t>(profile.platform)];
+  const StringSet* set = built.load(std::memory_order_acquire);
+  if (set == nullptr) [[unlikely]] {
+    const std::lock_guard lock(building);
+    // Another thread may have built it while we waited; the log must name a set only once.
+    set = built.load(std::memory_order_relaxed);
+    if (set == nullptr) {
+      set = new StringSet(profile.whitelist);
+      tesselReporterLog().debug("Using string whitelist with %lu elements for %@ platform",
+                                set->size(), profile.name);
+      built.store(set, std::memory_order_release);
     }
-    case TesselReporterPlatform::unknown:
-      break;
   }
-  return unknownPlatformWhitelist();
+  if (profile.logsEveryWhitelistLookup)
+    tesselReporterLog().debug("Using string whitelist with %lu elements", set->size());
+  return *set;
 }
 
 bool stringIsWhitelisted(StringRef value, TesselReporterPlatform platform) {

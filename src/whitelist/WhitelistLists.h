@@ -11,6 +11,8 @@
 namespace tessel {
 
 using StringList = std::span<const std::string_view>;
+// One of the functions below.
+using StringListSource = StringList (*)();
 
 // Desktop user-interface components on which a performance-logged operation acts. Repeats some.
 StringList perfLoggingComponentNames();

@@ -10,7 +10,6 @@
 #include <set>
 
 #include "platform/testing/Fakes.h"
-#include "whitelist/WhitelistLists.h"
 
 namespace tessel {
 namespace {
@@ -123,6 +122,17 @@ TEST(StringWhitelistTest, APerfLoggingOperationIsKnownByAllThreeStrings) {
     EXPECT_FALSE(isPerfLoggingOperation(subsystem, wrong, name));
     EXPECT_FALSE(isPerfLoggingOperation(subsystem, category, wrong));
   }
+}
+
+TEST(PlatformProfileTest, NamesAndCodesBelongTogether) {
+  for (uint64_t code = 0; code <= 5; ++code) {
+    const auto platform = static_cast<Platform>(code);
+    EXPECT_EQ(platformFromName(SharedString(nameForPlatform(platform))), platform);
+  }
+  EXPECT_EQ(nameForPlatform(currentPlatform()), "Selvin");
+  EXPECT_EQ(nameForPlatform(static_cast<Platform>(6)), "Unknown");
+  EXPECT_EQ(platformFromName(SharedString("selvin")), Platform::unknown);
+  EXPECT_EQ(platformFromName({}), Platform::unknown);
 }
 
 }  // namespace

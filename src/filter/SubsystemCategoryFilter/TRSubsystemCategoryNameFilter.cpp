@@ -162,4 +162,37 @@ void TRSubsystemCategoryNameFilter::addEntryWithSubsystem(StringRef subsystem, S
   filterTreeRoot_->setCap(cap, downsampleRatio, FilterQuery(subsystem, category, name));
 }
 
+std::optional<DownsampleConfiguration> defaultConfigurationForPlatform(
+    TesselReporterPlatform platform) {
+  DownsampleConfiguration rows;
+  for (const DownsampleRow& row : profileOf(platform).downsampling) {
+    auto& dictionary = rows.emplace_back();
+    dictionary["Subsystem"] = {std::string(row.subsystem)};
+    if (!row.category.empty()) dictionary["Category"] = {std::string(row.category)};
+    if (!row.name.empty()) dictionary["Name"] = {std::string(row.name)};
+    dictionary["Cap"] = {Number(row.cap)};
+    dictionary["DownsampleRatio"] = {Number(row.ratio)};
+  }
+  return rows.empty() ? std::nullopt : std::optional(std::move(rows));
+}
+
+std::shared_ptr<TRSubsystemCategoryNameFilter> defaultFilterForPlatform(
+    TesselReporterPlatform platform) {
+  using Filters = std::vector<std::shared_ptr<TRSubsystemCategoryNameFilter>>;
+  // Never destroyed: a run may still ask while another thread ends the process.
+  static const Filters& filters = *new Filters([] {
+    Filters made;
+    for (const PlatformProfile& profile : platformProfiles())
+      made.push_back(makeDefaultFilterForPlatform(profile.platform));
+    return made;
+  }());
+  return filters[static_cast<size_t>(profileOf(platform).platform)];
+}
+
+std::shared_ptr<TRSubsystemCategoryNameFilter> makeDefaultFilterForPlatform(
+    TesselReporterPlatform platform) {
+  return TRSubsystemCategoryNameFilter::initWithDictionaryArray(
+      defaultConfigurationForPlatform(platform));
+}
+
 }  // namespace tessel

@@ -23,6 +23,7 @@
 #include "objects/TesselObject.h"
 #include "platform/Analytics.h"
 #include "platform/SharedString.h"
+#include "whitelist/PlatformProfile.h"
 
 namespace tessel {
 
@@ -173,5 +174,18 @@ class TRSubsystemCategoryNameFilter {
 
   const std::unique_ptr<FilterTier> filterTreeRoot_;
 };
+
+// The downsampling that the platform's profile holds; nothing where it downsamples nothing.
+std::optional<DownsampleConfiguration> defaultConfigurationForPlatform(
+    TesselReporterPlatform platform);
+
+// The filter made of it that all runs of the process share, because a cap holds for the process:
+// its counters go on from run to run. Null where there is no configuration. Any thread may ask.
+std::shared_ptr<TRSubsystemCategoryNameFilter> defaultFilterForPlatform(
+    TesselReporterPlatform platform);
+
+// A filter of its own from the same configuration, with counters at zero; null as above.
+std::shared_ptr<TRSubsystemCategoryNameFilter> makeDefaultFilterForPlatform(
+    TesselReporterPlatform platform);
 
 }  // namespace tessel

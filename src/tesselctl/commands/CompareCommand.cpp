@@ -52,7 +52,7 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
       period.last = word.substr(5);
     } else {
       fail(kUsage, "'" + word + "' is no setting; settings are usual, internal, no-internal, " +
-                       kPlatformNames + ", since=DATE, until=DATE, last=DURATION");
+                       platformNames() + ", since=DATE, until=DATE, last=DURATION");
       return {};
     }
   }

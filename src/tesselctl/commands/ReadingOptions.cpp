@@ -26,9 +26,8 @@ void addPeriodOptions(CLI::App& command, ReadingOptions& options) {
 }
 
 void addJudgeOptions(CLI::App& command, ReadingOptions& options) {
-  command.add_option(
-      "--platform", options.platform,
-      std::string("Judge as on this platform: ") + kPlatformNames + " [this build's]");
+  command.add_option("--platform", options.platform,
+                     "Judge as on this platform: " + platformNames() + " [this build's]");
   const auto internal =
       command.add_flag("--internal", options.internal,
                        "Judge as on a build with internal diagnostics [as this machine says]");
@@ -55,7 +54,7 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const LaunchConf
     const auto platform = platformNamed(*options.platform);
     if (!platform) {
       fail(kUsage,
-           "--platform: '" + terminalText(*options.platform) + "' is none of " + kPlatformNames);
+           "--platform: '" + terminalText(*options.platform) + "' is none of " + platformNames());
       return {};
     }
     reading.machine.platform = *platform;

@@ -38,7 +38,6 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const LaunchConf
                                  Date now);
 
 std::optional<TesselReporterPlatform> platformNamed(const std::string& name);
-inline constexpr char kPlatformNames[] = "Quarro, Selvin, Darrow, Fennic, Lumet";
 
 // Says what a reader should know before trusting the figures: files that could not be read.
 // The status that this makes of `status`.

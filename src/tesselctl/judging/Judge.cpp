@@ -4,8 +4,6 @@
 
 #include <numeric>
 
-#include "filter/DefaultDownsampling.h"
-
 namespace tessel::ctl {
 
 uint64_t sumOf(const VerdictCounts& counts) {
