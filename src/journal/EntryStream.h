@@ -6,6 +6,8 @@
 // out of the list.
 //
 // Threads: one at a time, but for StopFlag.
+//
+// The cursor of an entry: its place in text form, as `journalctl --cursor=` takes it.
 
 #pragma once
 
@@ -13,7 +15,9 @@
 #include <atomic>
 #include <cstdint>
 #include <cstring>
+#include <optional>
 #include <span>
+#include <string>
 #include <string_view>
 #include <vector>
 
@@ -99,5 +103,16 @@ class EntryStream {
   virtual const EntryHeader& header() const = 0;
   virtual Entry entry() = 0;
 };
+
+// "s=<sequence id>;i=<number>;b=<boot id>;m=<monotonic>;t=<realtime>;x=<content hash>", in
+// hexadecimal.
+std::string cursorOf(const EntryHeader& header);
+
+// The header that a cursor names; nothing where a part is missing or no hexadecimal number.
+std::optional<EntryHeader> parseCursor(std::string_view cursor);
+
+// 32 hexadecimal digits, with or without the dashes of a UUID; nothing for any other text.
+std::optional<Id128> parseId128(std::string_view text);
+std::string textOf(const Id128& id);
 
 }  // namespace tessel

@@ -14,11 +14,10 @@
 #include <optional>
 
 #include "journal/Decompressor.h"
-#include "journal/EntryChain.h"
+#include "journal/EntryIndex.h"
 #include "journal/EntrySearch.h"
 #include "journal/EntryStream.h"
 #include "journal/JournalFile.h"
-#include "journal/MarkedEntries.h"
 #include "journal/StoreReport.h"
 #include "journal/TokenCache.h"
 

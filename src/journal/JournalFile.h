@@ -15,8 +15,8 @@
 #include <variant>
 
 #include "journal/EntryStream.h"
+#include "journal/FileWindows.h"
 #include "journal/JournalFormat.h"
-#include "journal/WindowedFile.h"
 #include "platform/Error.h"
 
 namespace tessel {

@@ -4,12 +4,11 @@
 #include <utility>
 #include <vector>
 
+#include "journal/EntryMerger.h"
 #include "journal/ExportEntryStream.h"
-#include "journal/ForeignJournalStream.h"
 #include "journal/JournalEntryStream.h"
 #include "journal/LossTokenizer.h"
 #include "journal/StoreFiles.h"
-#include "journal/StoreMerger.h"
 
 namespace tessel {
 

@@ -9,7 +9,7 @@
 #include <sys/mman.h>
 #include <unistd.h>
 
-#include "journal/EntryCursor.h"
+#include "journal/EntryStream.h"
 
 namespace tessel {
 namespace {

@@ -12,7 +12,7 @@
 #include <map>
 #include <random>
 
-#include "journal/ForeignJournalStream.h"
+#include "journal/ExportEntryStream.h"
 #include "journal/JournalFormat.h"
 #include "journal/LossTokenizer.h"
 #include "journal/testing/JournalOracle.h"

@@ -1,6 +1,6 @@
 // What is appended is what is read back, by whoever writes and however many.
 
-#include "journal/ExportFile.h"
+#include "journal/EntryRecording.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

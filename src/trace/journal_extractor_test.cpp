@@ -8,8 +8,8 @@
 #include <chrono>
 #include <thread>
 
-#include "journal/EntryCursor.h"
-#include "journal/ExportFile.h"
+#include "journal/EntryRecording.h"
+#include "journal/EntryStream.h"
 #include "os/testing/TemporaryDirectory.h"
 #include "platform/testing/Fakes.h"
 #include "trace/testing/FakeEntryStream.h"

@@ -15,7 +15,7 @@
 #include <string_view>
 #include <thread>
 
-#include "journal/EntryCursor.h"
+#include "journal/EntryStream.h"
 #include "journal/TraceStore.h"
 #include "journal/testing/JournalOracle.h"
 

@@ -9,7 +9,7 @@
 #include <filesystem>
 #include <ostream>
 
-#include "journal/EntryCursor.h"
+#include "journal/EntryStream.h"
 #include "journal/ExportEntryStream.h"
 
 namespace tessel::testing {

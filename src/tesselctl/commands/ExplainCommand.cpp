@@ -8,7 +8,7 @@
 #include <memory>
 #include <vector>
 
-#include "journal/EntryCursor.h"
+#include "journal/EntryStream.h"
 #include "linux/AppBundles.h"
 #include "linux/SystemFacts.h"
 #include "service/BootVolume.h"

@@ -8,9 +8,8 @@
 #include <memory>
 #include <system_error>
 
-#include "journal/EntryCursor.h"
-#include "journal/ExportFile.h"
-#include "journal/JournalSocket.h"
+#include "journal/EntryRecording.h"
+#include "journal/EntryStream.h"
 #include "tesselctl/commands/Commands.h"
 #include "tesselctl/commands/RecordedPoint.h"
 

@@ -8,7 +8,7 @@
 #include <variant>
 #include <vector>
 
-#include "journal/ExportFile.h"
+#include "journal/EntryRecording.h"
 #include "objects/TesselObject.h"
 
 namespace tessel::ctl {

@@ -1,4 +1,4 @@
-#include "journal/EntryCursor.h"
+#include "journal/EntryStream.h"
 
 #include <charconv>
 #include <cstddef>

@@ -2,6 +2,8 @@
 //
 // Any number of processes may append to one file: each entry is written whole, under a lock of the
 // file. What the daemon would have added comes from the caller.
+//
+// Sending an entry to the journal daemon of this machine.
 
 #pragma once
 
@@ -43,5 +45,9 @@ std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
 std::optional<PlatformError> appendToExportFile(const std::string& directory,
                                                 const RecordOrigin& origin,
                                                 const std::vector<RecordedField>& fields);
+
+// Hands one entry to the daemon. An error says why it could not be handed over, a daemon that is
+// not there included, which the system's own library does not tell.
+std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields);
 
 }  // namespace tessel
