@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "journal/JournalEntryStream.h"
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "trace/TracePointTable.h"
 
 namespace {
@@ -60,7 +60,7 @@ void readAll(JournalEntryStream& stream, const TracePointTable& table, size_t mo
 // made once for many.
 uint32_t nextNumber() {
   static uint32_t runs = 0;
-  return runs++ % TraceStore::kMaxFiles;
+  return runs++ % JournalStore::kMaxFiles;
 }
 
 JournalReadResources& resources(uint32_t number) {

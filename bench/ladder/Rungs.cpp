@@ -8,7 +8,7 @@
 #include <optional>
 #include <string_view>
 
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "trace/JournalExtractor.h"
 #include "trace/TracePointTable.h"
 
@@ -38,7 +38,7 @@ class Glance final : public FieldTokenizer {
 uint64_t readAlone(const std::string& directory) {
   Glance glance;
   StopFlag stop{false};
-  auto opened = TraceStore::open(directory, {}, glance, stop);
+  auto opened = JournalStore::open(directory, {}, glance, stop);
   if (auto* error = std::get_if<PlatformError>(&opened)) fail(error->words);
   EntryStream& entries = std::get<0>(opened)->entries();
   uint64_t count = 0;

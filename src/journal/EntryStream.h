@@ -1,4 +1,4 @@
-// EntryStream: the entries of a trace store, one after another, their fields as small integers.
+// EntryStream: the entries of a journal store, one after another, their fields as small integers.
 //
 // A store keeps each distinct FIELD=value once and an entry refers to it. So the reader shows each
 // distinct value once to a FieldTokenizer, which parses and interns it and answers with a token;

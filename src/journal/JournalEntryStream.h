@@ -46,7 +46,7 @@ class JournalEntryStream final : public EntryStream {
   };
 
   // Reads the file of `fd`, of `size` bytes, whose header is `header`. `number` tells the files of
-  // one store apart and is below TraceStore::kMaxFiles.
+  // one store apart and is below JournalStore::kMaxFiles.
   JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header, uint32_t number,
                      const Context& context);
 

@@ -1,4 +1,4 @@
-// StoreFiles: finds and opens the files of a trace store.
+// StoreFiles: finds and opens the files of a journal store.
 //
 // Files are held open from the moment they are found and known by device and inode. The place is
 // listed again until nothing new shows up, so that a file that is renamed meanwhile is neither lost

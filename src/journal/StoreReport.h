@@ -1,4 +1,4 @@
-// StoreReport: what the reader of a trace store knows about what it read and what it could not.
+// StoreReport: what the reader of a journal store knows about what it read and what it could not.
 //
 // Plain values. A report is filled by the one thread that reads and copied out for others.
 

@@ -15,7 +15,7 @@
 #include <random>
 
 #include "journal/JournalFormat.h"
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "journal/testing/JournalDamage.h"
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
@@ -41,9 +41,9 @@ Outcome read(const std::string& path, size_t pause = SIZE_MAX,
              const std::function<void()>& meanwhile = {}) {
   testing::RecordingTokenizer tokenizer;
   StopFlag stop{false};
-  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  auto opened = JournalStore::open(path, {}, tokenizer, stop);
   if (opened.index() == 1) return {{}, true, true};
-  TraceStore& store = *std::get<0>(opened);
+  JournalStore& store = *std::get<0>(opened);
   Outcome outcome;
   while (store.entries().next()) {
     outcome.numbers.push_back(store.entries().entry().header.sequenceNumber);

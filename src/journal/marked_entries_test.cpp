@@ -9,7 +9,7 @@
 #include <set>
 
 #include "journal/JournalFormat.h"
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "journal/testing/JournalDamage.h"
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
@@ -68,7 +68,7 @@ class MarkedEntriesTest : public ::testing::TestWithParam<bool> {
                 std::string_view field = "MESSAGE=") {
     testing::RecordingTokenizer tokenizer(marks);
     const StopFlag stop{false};
-    auto opened = TraceStore::open(directory_.write("a.journal", bytes), {}, tokenizer, stop);
+    auto opened = JournalStore::open(directory_.write("a.journal", bytes), {}, tokenizer, stop);
     Numbers numbers;
     if (opened.index() == 1) return numbers;
     EntryStream& entries = std::get<0>(opened)->entries();

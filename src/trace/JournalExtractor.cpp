@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 
 namespace tessel {
 
@@ -52,12 +52,12 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
     return true;
   }
   const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
-  auto opened = TraceStore::open(path ? path : systemStore_, range, table_, stop_);
+  auto opened = JournalStore::open(path ? path : systemStore_, range, table_, stop_);
   if (auto* error = std::get_if<PlatformError>(&opened)) {
     errorOut = std::move(*error);
     return false;
   }
-  TraceStore& store = *std::get<std::unique_ptr<TraceStore>>(opened);
+  JournalStore& store = *std::get<std::unique_ptr<JournalStore>>(opened);
   processEntries(store.entries());
   report_.store = store.report();
   logReport(report());

@@ -16,7 +16,7 @@
 #include <thread>
 
 #include "journal/EntryStream.h"
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "journal/testing/JournalOracle.h"
 
 namespace {
@@ -72,7 +72,7 @@ std::vector<PlainEntry> readLedByKind(const std::string& path, const std::vector
                                       size_t& spared) {
   testing::RecordingTokenizer tokenizer({{"TESSEL_KIND"}});
   const StopFlag stop{false};
-  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  auto opened = JournalStore::open(path, {}, tokenizer, stop);
   std::vector<PlainEntry> led = testing::readAll(std::get<0>(opened)->entries(), tokenizer);
   for (size_t i = 0; i < std::min(led.size(), all.size()); ++i) {
     const auto isKind = [](const std::string& field) { return field.starts_with("TESSEL_KIND="); };
@@ -86,12 +86,12 @@ std::vector<PlainEntry> readLedByKind(const std::string& path, const std::vector
 int compare(const std::string& path, bool withOthers) {
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
-  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  auto opened = JournalStore::open(path, {}, tokenizer, stop);
   if (const auto* error = std::get_if<PlatformError>(&opened)) {
     std::cout << error->words << "\n";
     return 2;
   }
-  TraceStore& store = *std::get<0>(opened);
+  JournalStore& store = *std::get<0>(opened);
   const std::vector<PlainEntry> ours =
       withOthers ? testing::readAll(store.entries(), tokenizer) : readHeaders(store.entries());
   const StoreReport report = store.report();
@@ -120,7 +120,7 @@ int stopMeanwhile(const std::string& path, std::chrono::milliseconds after) {
   });
   size_t entries = 0;
   {
-    auto opened = TraceStore::open(path, {}, tokenizer, stop);
+    auto opened = JournalStore::open(path, {}, tokenizer, stop);
     if (auto* store = std::get_if<0>(&opened))
       for (; (*store)->entries().next(); ++entries) (*store)->entries().entry();
   }

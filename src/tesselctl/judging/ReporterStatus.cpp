@@ -5,7 +5,7 @@
 
 #include <memory>
 
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "linux/Scheduler.h"
 #include "linux/StateDirectory.h"
 #include "linux/SystemFacts.h"
@@ -31,13 +31,13 @@ Marker lookForMarker() {
 JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   TracePointTable table;
   const StopFlag stop = false;
-  auto opened = TraceStore::open(store, TimeRange{}, table, stop);
+  auto opened = JournalStore::open(store, TimeRange{}, table, stop);
   JournalFacts facts;
   if (const auto* error = std::get_if<PlatformError>(&opened)) {
     facts.failure = error->words;
     return facts;
   }
-  auto& trace = *std::get<std::unique_ptr<TraceStore>>(opened);
+  auto& trace = *std::get<std::unique_ptr<JournalStore>>(opened);
   trace.entries().next();  // files whose headers do not tell show their first entry
   if (const auto oldest = trace.report().oldestEntry) {
     facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};

@@ -131,9 +131,9 @@ DryRun::DryRun(std::optional<std::string> store, Visitor visitor)
 
 std::optional<PlatformError> DryRun::readOnce(TimeRange range,
                                               const std::function<void(EntryStream&)>& process) {
-  auto opened = TraceStore::open(store_, range, extractor_.tokenizer(), extractor_.stopFlag());
+  auto opened = JournalStore::open(store_, range, extractor_.tokenizer(), extractor_.stopFlag());
   if (auto* error = std::get_if<PlatformError>(&opened)) return std::move(*error);
-  TraceStore& store = *std::get<std::unique_ptr<TraceStore>>(opened);
+  JournalStore& store = *std::get<std::unique_ptr<JournalStore>>(opened);
   process(store.entries());
   storeReport_ = store.report();
   return {};

@@ -13,7 +13,7 @@
 #include <optional>
 #include <string>
 
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "trace/JournalExtractor.h"
 

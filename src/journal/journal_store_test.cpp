@@ -1,7 +1,7 @@
 // Stores of files of every kind. What the journal's own tools write is read beside libsystemd and
 // journalctl in tests/reading.
 
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -38,9 +38,9 @@ struct Reading {
 Reading readStore(const std::string& path, TimeRange range = {}) {
   testing::RecordingTokenizer tokenizer;
   StopFlag stop{false};
-  auto opened = TraceStore::open(path, range, tokenizer, stop);
+  auto opened = JournalStore::open(path, range, tokenizer, stop);
   if (auto* error = std::get_if<PlatformError>(&opened)) return {{}, {}, error->words, error->code};
-  TraceStore& store = *std::get<0>(opened);
+  JournalStore& store = *std::get<0>(opened);
   Reading reading;
   reading.entries = testing::readAll(store.entries(), tokenizer);
   reading.report = store.report();
@@ -59,7 +59,7 @@ std::string someJournal(size_t count, uint64_t firstSequence = 1, JournalLayout 
   return writer.bytes();
 }
 
-TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
+TEST(JournalStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
   using namespace journal_format;
   const JournalLayout layouts[] = {
       {.compression = kXz},
@@ -84,7 +84,7 @@ TEST(TraceStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
   }
 }
 
-TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
+TEST(JournalStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
   const TemporaryDirectory directory;
   directory.write("a.journal", someJournal(20, 1));
   directory.write("b.journal", someJournal(20, 11));
@@ -101,7 +101,7 @@ TEST(TraceStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
 
 // Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
 // all of them.
-TEST(TraceStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
+TEST(JournalStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
   constexpr size_t kEntries = 60;
   for (unsigned seed = 0; seed < 10; ++seed) {
     std::mt19937 random(seed);
@@ -135,7 +135,7 @@ TEST(TraceStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
   }
 }
 
-TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
+TEST(JournalStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
   const TemporaryDirectory directory;
   constexpr uint64_t kBase = 1'795'300'000'000'000;
   directory.write("a.journal", someJournal(10, 1));
@@ -151,7 +151,7 @@ TEST(TraceStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
   EXPECT_TRUE(reading.report.reachesRangeStart());
 }
 
-TEST(TraceStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
+TEST(JournalStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
   const TemporaryDirectory directory;
   JournalWriter system, user({.sequenceId = {9}});
   for (uint64_t i = 1; i <= 40; ++i) {
@@ -173,7 +173,7 @@ TEST(TraceStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
   EXPECT_EQ(numbers(readStore(a, {999, 1002})), (std::vector<uint64_t>{1, 29, 30, 31}));
 }
 
-TEST(TraceStoreTest, TellsGapsInTheSequence) {
+TEST(JournalStoreTest, TellsGapsInTheSequence) {
   const TemporaryDirectory directory;
   directory.write("a.journal", someJournal(10, 1));
   directory.write("b.journal", someJournal(10, 14));
@@ -185,7 +185,7 @@ TEST(TraceStoreTest, TellsGapsInTheSequence) {
   EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.sequenceGaps, 0u);
 }
 
-TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
+TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
   const TemporaryDirectory directory;
   JournalWriter writer;
   EntryHeader header;
@@ -205,7 +205,7 @@ TEST(TraceStoreTest, TellsWhatTheDaemonDropped) {
 }
 
 // Anyone may write such entries, with any values.
-TEST(TraceStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
+TEST(JournalStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
   const TemporaryDirectory directory;
   JournalWriter writer;
   EntryHeader header;
@@ -228,7 +228,7 @@ TEST(TraceStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
   EXPECT_EQ(reading.report.dropped[0].unit, "");
 }
 
-TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
+TEST(JournalStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
   const TemporaryDirectory directory;
   const std::string noise = directory.write("noise/noise.journal", std::string(5000, '\x5a'));
   EXPECT_THAT(readStore("/nowhere").error, HasSubstr("/nowhere: No such file"));
@@ -242,7 +242,7 @@ TEST(TraceStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
   EXPECT_EQ(readStore(directory.path("empty")).code, ErrorCode::notAStore);
 }
 
-TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {
+TEST(JournalStoreTest, ReadsTheGoodFilesAmongBadOnes) {
   const TemporaryDirectory directory;
   directory.write("bad.journal", std::string(5000, '\x5a'));
   directory.write("empty.journal", "");
@@ -254,7 +254,7 @@ TEST(TraceStoreTest, ReadsTheGoodFilesAmongBadOnes) {
 }
 
 // journalctl does not know the flag either, which is as near as a test comes to a newer one.
-TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
+TEST(JournalStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
   const TemporaryDirectory directory;
   std::string file = someJournal(10);
   file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
@@ -273,7 +273,7 @@ TEST(TraceStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
 }
 
 // It would else be decompressed for each of the entry's items.
-TEST(TraceStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
+TEST(JournalStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
   const TemporaryDirectory directory;
   JournalLayout layout;
   layout.compression = journal_format::kZstd;
@@ -290,24 +290,24 @@ TEST(TraceStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
   const std::string path = directory.write("a.journal", file);
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
-  auto opened = TraceStore::open(path, {}, tokenizer, stop);
+  auto opened = JournalStore::open(path, {}, tokenizer, stop);
   ASSERT_EQ(testing::readAll(std::get<0>(opened)->entries(), tokenizer).at(0).fields.size(), 1000u);
   EXPECT_EQ(tokenizer.shown(), 1u);
 }
 
-TEST(TraceStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
+TEST(JournalStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
   const TemporaryDirectory directory;
   std::string file = someJournal(1);
   file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
-  for (size_t i = 0; i <= TraceStore::kMaxForeignFiles; ++i)
+  for (size_t i = 0; i <= JournalStore::kMaxForeignFiles; ++i)
     directory.write(std::to_string(100 + i) + ".journal", file);
   const Reading reading = readStore(directory.path());
-  for (size_t i = 0; i < TraceStore::kMaxForeignFiles; ++i)
+  for (size_t i = 0; i < JournalStore::kMaxForeignFiles; ++i)
     EXPECT_EQ(reading.report.files.at(i).skipped, std::nullopt) << i;
   EXPECT_THAT(reading.report.files.back().skipped.value_or(""), HasSubstr("16 files before it"));
 }
 
-TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
+TEST(JournalStoreTest, JournalctlReadsForUsWhatItKnows) {
   const TemporaryDirectory directory;
   const std::string path = directory.write("a.journal", someJournal(100));
   testing::RecordingTokenizer tokenizer;
@@ -321,7 +321,7 @@ TEST(TraceStoreTest, JournalctlReadsForUsWhatItKnows) {
   EXPECT_TRUE(report.problems.empty());
 }
 
-TEST(TraceStoreTest, ReadsAFileOfSeveralNamesOnce) {
+TEST(JournalStoreTest, ReadsAFileOfSeveralNamesOnce) {
   const TemporaryDirectory directory;
   const std::string path = directory.write("a.journal", someJournal(10));
   std::filesystem::create_hard_link(path, directory.path("b.journal"));

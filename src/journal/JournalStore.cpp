@@ -1,4 +1,4 @@
-#include "journal/TraceStore.h"
+#include "journal/JournalStore.h"
 
 #include <algorithm>
 #include <utility>
@@ -65,14 +65,14 @@ void SequenceWatch::change(const EntryHeader& entry) {
   }
 }
 
-static_assert(TraceStore::kMaxFiles <= TokenCache::kMaxFiles);
+static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
 
 // Of a stream whose entries may count in any sequence.
 constexpr Id128 kNoSequence{};
 
 }  // namespace
 
-struct TraceStore::State final : EntryStream {
+struct JournalStore::State final : EntryStream {
   State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag)
       : range(timeRange), stop(stopFlag), tokenizer(user), merger(stopFlag) {
     facts.rangeStart = range.start;
@@ -106,7 +106,7 @@ struct TraceStore::State final : EntryStream {
   StoreMerger merger;
 };
 
-bool TraceStore::State::next() {
+bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
     sequences.see(entry);
@@ -119,12 +119,12 @@ bool TraceStore::State::next() {
   return false;
 }
 
-Entry TraceStore::State::entry() {
+Entry JournalStore::State::entry() {
   const Entry whole = merger.entry();
   return {whole.header, tokenizer.takeOwn(whole.tokens)};
 }
 
-void TraceStore::State::openFiles(StoreFiles found) {
+void JournalStore::State::openFiles(StoreFiles found) {
   facts.filesNotLookedAt = found.leftOut;
   facts.files.resize(found.files.size());
   for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
@@ -133,7 +133,7 @@ void TraceStore::State::openFiles(StoreFiles found) {
   }
 }
 
-void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
+void JournalStore::State::openFile(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   if (!file.fd.valid()) {
     report.skipped = whyNotOpened(file.error);
@@ -150,7 +150,7 @@ void TraceStore::State::openFile(StoreFile& file, uint32_t number) {
   }
 }
 
-void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
+void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   auto opened = readJournalHeader(file.fd.get());
   if (auto* error = std::get_if<PlatformError>(&opened)) {
@@ -177,7 +177,7 @@ void TraceStore::State::openJournal(StoreFile& file, uint32_t number) {
 }
 
 // Each such file takes a process, so not all of a great many are read.
-void TraceStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
+void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
   FileReport& report = facts.files[number];
   if (foreignFiles == kMaxForeignFiles) {
     report.skipped = "written with features that are not known, as are " +
@@ -197,7 +197,7 @@ void TraceStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32
 
 // A clock that was set back within the file shows where its ends stand the wrong way round; one
 // that was also set forward again does not, and the file counts as what its ends say.
-bool TraceStore::State::outsideRange(const JournalHeader& header) const {
+bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   if (header.beingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
     return false;
@@ -205,7 +205,7 @@ bool TraceStore::State::outsideRange(const JournalHeader& header) const {
 }
 
 // Why the store as a whole cannot be used, where that is so.
-std::optional<PlatformError> TraceStore::State::failure(const std::string& place) const {
+std::optional<PlatformError> JournalStore::State::failure(const std::string& place) const {
   if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
   if (facts.files.empty())
     return PlatformError{ErrorCode::notAStore,
@@ -214,10 +214,10 @@ std::optional<PlatformError> TraceStore::State::failure(const std::string& place
   return PlatformError{firstFailure, first.path + ": " + first.skipped.value_or("not readable")};
 }
 
-TraceStore::TraceStore(std::unique_ptr<State> state) : state_(std::move(state)) {}
-TraceStore::~TraceStore() = default;
+JournalStore::JournalStore(std::unique_ptr<State> state) : state_(std::move(state)) {}
+JournalStore::~JournalStore() = default;
 
-std::variant<std::unique_ptr<TraceStore>, PlatformError> TraceStore::open(
+std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
     const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
     const StopFlag& stop) {
   auto found = openStoreFiles(path, kMaxFiles, stop);
@@ -226,12 +226,12 @@ std::variant<std::unique_ptr<TraceStore>, PlatformError> TraceStore::open(
   auto state = std::make_unique<State>(range, tokenizer, stop);
   state->openFiles(std::get<StoreFiles>(std::move(found)));
   if (auto error = state->failure(place)) return std::move(*error);
-  return std::unique_ptr<TraceStore>(new TraceStore(std::move(state)));
+  return std::unique_ptr<JournalStore>(new JournalStore(std::move(state)));
 }
 
-EntryStream& TraceStore::entries() { return *state_; }
+EntryStream& JournalStore::entries() { return *state_; }
 
-StoreReport TraceStore::report() const {
+StoreReport JournalStore::report() const {
   StoreReport report = state_->facts;
   report.duplicateEntries = state_->merger.duplicates();
   report.sequenceGaps = state_->sequences.gaps();

@@ -1,4 +1,4 @@
-// TraceStore: the journal and export files of one place, opened for one time range and merged.
+// JournalStore: the journal and export files of one place, opened for one time range and merged.
 //
 // A store is a directory that holds `*.journal`, `*.journal~` or `*.export` files at any depth, one
 // such file, or the machine's own journal. Its files are held open from the beginning and known by
@@ -25,7 +25,7 @@ struct TimeRange {
   uint64_t end = UINT64_MAX;
 };
 
-class TraceStore {
+class JournalStore {
  public:
   // Files of a store that are looked at; the others are counted in the report.
   static constexpr size_t kMaxFiles = 8192;
@@ -34,15 +34,15 @@ class TraceStore {
 
   // Opens the store at `path`, the machine's own journal where it is absent. An error names the
   // path and the reason: there is no such place, it may not be read, it holds nothing that is a
-  // trace store. A damaged file among good ones is no error but a line of the report.
+  // journal store. A damaged file among good ones is no error but a line of the report.
   // `tokenizer` and `stop` must outlive the store.
-  static std::variant<std::unique_ptr<TraceStore>, PlatformError> open(
+  static std::variant<std::unique_ptr<JournalStore>, PlatformError> open(
       const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
       const StopFlag& stop);
 
-  ~TraceStore();
-  TraceStore(const TraceStore&) = delete;
-  TraceStore& operator=(const TraceStore&) = delete;
+  ~JournalStore();
+  JournalStore(const JournalStore&) = delete;
+  JournalStore& operator=(const JournalStore&) = delete;
 
   // The entries of the range in the journal's own order, each once.
   EntryStream& entries();
@@ -51,7 +51,7 @@ class TraceStore {
 
  private:
   struct State;
-  explicit TraceStore(std::unique_ptr<State> state);
+  explicit JournalStore(std::unique_ptr<State> state);
 
   std::unique_ptr<State> state_;
 };
