@@ -1,4 +1,10 @@
 // Reading configurations and watching their files.
+//
+// A file is watched in two ways at once. inotify on its directory tells of a change within a
+// millisecond. It is blind to some: a directory that is made later, a link on the way that is
+// replaced, a file system without notifications. A look every quarter of a second finds those, and
+// costs one read of a small file. To watch every directory of the path would still miss the last
+// case, and needs far more code.
 
 #include "statora/ConfigurationFiles.h"
 
@@ -27,7 +33,8 @@ namespace {
 
 using Json = nlohmann::json;
 
-// Each handler answers whether parsing goes on.
+// Builds the value from the parser's events, and not from a finished document, so that the depth is
+// bounded before anything is built. Each handler answers whether parsing goes on.
 class Builder final : public nlohmann::json_sax<Json> {
  public:
   bool null() override { return add({}); }
@@ -93,7 +100,7 @@ class Builder final : public nlohmann::json_sax<Json> {
 }  // namespace
 
 std::shared_ptr<const ConfigurationValue> parseConfiguration(std::string_view text) {
-  // The parser takes a null byte for the end of its input.
+  // The parser takes a null byte for the end and would accept whatever follows.
   if (text.find('\0') != std::string_view::npos) return nullptr;
   Builder builder;
   if (!Json::sax_parse(text.begin(), text.end(), &builder)) return nullptr;
@@ -112,7 +119,7 @@ std::optional<ConfigurationChanges::Report> ConfigurationChanges::look(Configura
   }
   unconfirmed_.reset();
   told_ = std::move(seen);
-  // Absent for another reason than before is no change.
+  // The delegate knows of one absence only, so another reason for it is no change.
   if (std::exchange(absenceTold_, !configuration) && !configuration) return {};
   return Report{std::move(configuration)};
 }
@@ -121,7 +128,8 @@ namespace {
 
 constexpr std::chrono::milliseconds kLookInterval{250};
 
-// What stands at the path.
+// A file that exists but cannot be read is told from a missing one: each must last for two looks by
+// itself before it counts as absence.
 ConfigurationFile readFile(const std::string& path) {
   auto text = readSmallFile(path, FileConfigurationService::kMaxFileBytes);
   if (text) return {true, std::move(text)};
@@ -130,7 +138,7 @@ ConfigurationFile readFile(const std::string& path) {
   return {!missing, {}};
 }
 
-// What the watching thread works on. Shared with the observer, which only ends it.
+// What the watching thread works on. The observer shares it, to end the thread through `ended`.
 struct Watch {
   Watch(std::string directoryIn, std::string typeIn)
       : directory(std::move(directoryIn)),
@@ -143,21 +151,24 @@ struct Watch {
   const UniqueFd inotify{::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)};
   const UniqueFd ended{::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)};
 
-  // Watches the directory that the path leads to now. The kernel knows a directory that is watched
-  // already, and forgets one that is gone.
+  // Watches the directory that the path leads to now. Called before every look, because the path
+  // may lead elsewhere by then. The kernel gives a directory that it already watches no second
+  // watch, and drops the watch of one that is gone.
   void watchDirectory() const {
     ::inotify_add_watch(
         inotify.get(), directory.c_str(),
         IN_CLOSE_WRITE | IN_MODIFY | IN_CREATE | IN_DELETE | IN_MOVE | IN_ATTRIB | IN_ONLYDIR);
   }
 
-  // True when something happened or `timeout` passed, false when it is over.
+  // True if something happened or `timeout` passed, false if the observer is gone. Without
+  // `heedEvents` only time counts: a burst of events must not confirm an absence too soon.
   bool wait(std::chrono::milliseconds timeout, bool heedEvents) const {
     std::array<pollfd, 2> waited{
         {{ended.get(), POLLIN, 0}, {heedEvents ? inotify.get() : -1, POLLIN, 0}}};
     if (::poll(waited.data(), waited.size(), static_cast<int>(timeout.count())) < 0 &&
         errno != EINTR)
       return false;
+    // What happened does not matter, only that something did: the look that follows tells.
     std::array<char, 4096> discarded{};
     while (::read(inotify.get(), discarded.data(), discarded.size()) > 0) {
     }
@@ -182,6 +193,7 @@ class FileObserver final : public ConfigurationObserver,
   }
 
   void startObserving(const std::string& type) override {
+    // A type with a slash would lead out of the directory.
     if (watch_ || type.find('/') != std::string::npos) return;
     watch_ = std::make_shared<Watch>(directory_, type);
     try {
@@ -189,7 +201,8 @@ class FileObserver final : public ConfigurationObserver,
         observe(*watch, observer);
       }).detach();
     } catch (const std::system_error&) {
-      // No thread to be had: the delegate is never called, as where there is no configuration.
+      // Without a thread the delegate is never called, as if there were no configuration. The
+      // service then works without it.
     }
   }
 
@@ -199,6 +212,7 @@ class FileObserver final : public ConfigurationObserver,
     do {
       watch.watchDirectory();
       if (auto report = changes.look(readFile(watch.path))) {
+        // The thread must not keep the observer alive, or dropping it would never end the thread.
         const auto target = observer.lock();
         if (!target) return;
         target->deliver(std::move(report->configuration), watch.type);

@@ -1,4 +1,18 @@
 // Reading, acknowledging and setting aside rows of the spool.
+//
+// Delivery is at least once. A row leaves `events` only after a collector has taken or refused it,
+// in the same transaction that moves the counters. If the forwarder dies between the collector's
+// answer and that transaction, the next forwarder sends the row again under the same identifier
+// (spool id and row id), and the backend keeps one of the two. Exactly once would need a collector
+// that remembers identifiers in a transaction with us, and none does.
+//
+// A collector may refuse a row for ever. Such a row moves to `forwarder_set_aside`, or all rows
+// behind it would wait with it. There it keeps the collector's words until somebody puts it back
+// (requeue) or newer ones push it out.
+//
+// No transaction here flushes the disk (synchronous=NORMAL), unlike the service's. After a power
+// cut an acknowledgement may be lost; the delivery is then repeated, which at least once allows.
+// The price of a flush would fall on the service, whose sends wait for this lock.
 
 #include "statora/ForwarderState.h"
 
@@ -8,16 +22,18 @@
 #include <algorithm>
 #include <utility>
 
+#include "platform/Invariant.h"
 #include "statora/Spool.h"
 
 namespace tessel {
 
 namespace {
 
-// The forwarder has time; the service goes first.
+// The service waits 250 ms at most for a lock, so that it goes first: the forwarder has time.
 constexpr int kForwardersPatience = 5000;  // milliseconds
 
-// Few enough that the service, whose next send may come at any moment, has no need to wait.
+// Rows of one transaction. A full batch of 512 would hold the lock four times as long, and a send
+// of the service may come at any moment.
 constexpr size_t kRowsRemovedAtOnce = 128;
 
 constexpr char kTables[] =
@@ -70,10 +86,11 @@ bool ForwarderState::exists() const {
 }
 
 SqliteStatus ForwarderState::open() {
+  // The service renames a damaged spool and begins a new one under the old name.
   if (database_.isOpen() && isStillThere()) return {};
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
-  // A lost acknowledgement is no lost event, so none is flushed. The write-ahead log, which grows
-  // here, is emptied here, before the service comes to do it in the middle of a send.
+  // Acknowledgements make the log grow, so the forwarder empties it at half the length at which the
+  // service would have to, in the middle of a send.
   if (status.ok())
     status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
   if (status.ok() &&
@@ -101,7 +118,7 @@ bool ForwarderState::isStillThere() const {
 
 SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   for (SqliteStatement* statement : {&select_, &remove_, &keep_, &trim_, &count_}) *statement = {};
-  // Closing would empty and delete the write-ahead log by its name, which by now may be another's.
+  // close() would empty and delete the log by its name, and that may by now be the new spool's log.
   database_.abandon();
   struct stat facts {};
   if (::stat(path_.c_str(), &facts) == 0) {
@@ -142,6 +159,7 @@ SqliteStatus ForwarderState::prepareStatements() {
   return good ? SqliteStatus{} : database_.status();
 }
 
+// The reset at the end gives the read lock back: while it is held, no checkpoint can empty the log.
 std::vector<SpooledEvent> ForwarderState::oldest(size_t maxRows, size_t maxBytes, int64_t after) {
   std::vector<SpooledEvent> events;
   size_t bytes = 0;
@@ -171,7 +189,7 @@ bool ForwarderState::writeCounters() {
   });
 }
 
-// Ends a transaction: commits what went well and takes back what did not.
+// Ends a transaction: commits it if all went well, and takes all of it back otherwise.
 SqliteStatus ForwarderState::finish(bool good) {
   SqliteStatus status = good ? database_.execute("COMMIT") : database_.status();
   if (!status.ok()) database_.execute("ROLLBACK");
@@ -179,12 +197,16 @@ SqliteStatus ForwarderState::finish(bool good) {
 }
 
 SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, Date now) {
+  const uint64_t deliveredBefore = counters_.delivered;
+  const size_t acknowledged = ids.size();
   counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
   while (!ids.empty()) {
     const auto step = ids.first(std::min(ids.size(), kRowsRemovedAtOnce));
     if (SqliteStatus status = remove(step); !status.ok()) return status;
     ids = ids.subspan(step.size());
   }
+  // Each row was counted in one transaction, and in one only.
+  TESSEL_INVARIANT(counters_.delivered == deliveredBefore + acknowledged);
   return {};
 }
 
@@ -192,11 +214,13 @@ SqliteStatus ForwarderState::remove(std::span<const int64_t> ids) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
   counters_.delivered += ids.size();
+  // The position never goes back: rows that were set aside and requeued have lower ids.
   counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
   SqliteStatus status =
       finish(std::all_of(ids.begin(), ids.end(),
                          [this](int64_t id) { return remove_.bind(1, id).run(); }) &&
              writeCounters());
+  // The rows are still there, so they are not delivered.
   if (!status.ok()) counters_ = before;
   return status;
 }
@@ -210,6 +234,7 @@ SqliteStatus ForwarderState::setAside(const SpooledEvent& event, int64_t collect
   bool good = keep_.run() && remove_.bind(1, event.id).run() &&
               trim_.bind(1, static_cast<int64_t>(maxSetAside_)).run();
   if (good) {
+    // The last statement was the trimming, and what it removed is lost for good.
     counters_.setAsideDropped += static_cast<uint64_t>(database_.changes());
     ++counters_.setAside;
     good = writeCounters();
@@ -224,6 +249,7 @@ SqliteStatus ForwarderState::storeCounters() {
   return finish(writeCounters());
 }
 
+// The rows keep their ids. They are lower than those that wait, so they go out first.
 std::optional<int64_t> ForwarderState::requeue() {
   const SqliteStatus status = database_.execute(
       "BEGIN IMMEDIATE;"
@@ -231,10 +257,14 @@ std::optional<int64_t> ForwarderState::requeue() {
       "forwarder_set_aside;");
   const int64_t rows = database_.changes();
   const bool good = status.ok() && database_.execute("DELETE FROM forwarder_set_aside").ok();
+  // Both statements saw the same rows, being of one transaction.
+  TESSEL_INVARIANT(!good || database_.changes() == rows);
   if (!finish(good).ok()) return {};
   return rows;
 }
 
+// SQLite reuses the pages of removed rows but never makes the file shorter by itself. A VACUUM
+// would copy the whole file under the lock; this moves a few pages.
 bool ForwarderState::shrink(int pages) {
   if (database_.integer("PRAGMA freelist_count").value_or(0) == 0) return false;
   SqliteStatement vacuum =

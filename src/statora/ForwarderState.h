@@ -1,14 +1,9 @@
-// ForwarderState: the spool as the forwarder sees it, and what the forwarder keeps in it.
+// The spool as the forwarder sees it, and what the forwarder keeps in it.
 //
-// A row of `events` is there until a collector has taken it. Acknowledging removes rows, oldest
-// first, and moves the counters in one transaction, so that a forwarder that dies before it sends
-// them again under the same identifiers, and nothing is lost. Beside `events` stand
+// A row stays in `events` until a collector has taken it. The forwarder adds two tables:
 //
 //   forwarder            name and value of each counter
-//   forwarder_set_aside  rows that the collector refused, with when, its status and its words
-//
-// Rows are removed in small steps, each a transaction of its own, and none flushes the disk (a lost
-// acknowledgement only repeats a delivery), so that the service's sends hardly ever wait for it.
+//   forwarder_set_aside  the rows that a collector refused, with the time, its status and its words
 //
 // Threads: one at a time.
 
@@ -30,13 +25,13 @@ struct SpooledEvent {
   int64_t id = 0;
   int64_t time = 0;  // microseconds since 1970
   std::string name;
-  std::string payload;  // a JSON object, unless the spool was tampered with
+  std::string payload;  // a JSON object, unless somebody tampered with the spool
 };
 
-// What the forwarder did with this spool, ever.
+// What the forwarder has done with this spool since the spool was made.
 struct ForwarderCounters {
-  uint64_t delivered = 0;        // records that a collector took, those it then rejected included
-  uint64_t rejected = 0;         // of these: told to be rejected in a partial success
+  uint64_t delivered = 0;        // records that a collector took, including rejected ones
+  uint64_t rejected = 0;         // of the delivered ones: rejected in a partial success
   uint64_t setAside = 0;         // records that were refused and set aside
   uint64_t setAsideDropped = 0;  // of these: the oldest, given up to stay within the limit
   uint64_t requests = 0;
@@ -48,7 +43,7 @@ struct ForwarderCounters {
   bool operator==(const ForwarderCounters&) const = default;
 };
 
-// Nothing where no forwarder ever worked on this spool.
+// Absent if no forwarder ever worked on this spool.
 std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database);
 
 class ForwarderState {
@@ -59,32 +54,36 @@ class ForwarderState {
 
   // Whether there is a spool.
   bool exists() const;
-  // Opens the spool, with which nothing happens where it is open already and still the one that
-  // stands there. Never makes one: that there is none is a failure like others.
+  // Opens the spool. Does nothing if it is open and its file still stands at its path. A missing
+  // spool is a failure: only the service makes one.
   SqliteStatus open();
-  // The same without leave to change anything.
+  // Opens the spool for oldest() and spoolId() alone; nothing in it can be changed.
   SqliteStatus openReadOnly();
   // The following REQUIRE an open spool.
   const std::string& spoolId() const { return spoolId_; }
 
-  // The oldest rows with an id above `after`: up to `maxRows`, and no more once they hold
-  // `maxBytes`. None where that fails; see status().
+  // The oldest rows with an id above `after`, up to `maxRows` rows or until they hold `maxBytes`.
+  // Empty if that fails; status() then says why.
   std::vector<SpooledEvent> oldest(size_t maxRows, size_t maxBytes, int64_t after = 0);
   SqliteStatus status() const { return database_.status(); }
-  // How many rows wait, judged by their ids.
+  // About how many rows wait: the span of their ids, because counting would read the whole table.
   uint64_t waiting();
 
-  // The counters to be stored with the next acknowledgement or setting aside.
+  // The counters. The next acknowledgement or setting aside stores them.
   ForwarderCounters& counters() { return counters_; }
-  // Counts the rows as delivered and removes them.
+  // Counts the rows as delivered and removes them, in transactions of a few rows each. If it fails,
+  // the rows of the finished transactions are gone and counted, and the others wait. `ids` ascend.
   SqliteStatus acknowledge(std::span<const int64_t> ids, Date now);
+  // Moves a row to the table of refused ones, with the collector's answer. Beyond the limit the
+  // oldest refused row is given up.
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
                         Date now);
   // Stores the counters alone.
   SqliteStatus storeCounters();
-  // Puts what was set aside back among what waits; how many rows, or nothing where it fails.
+  // Puts all rows that were set aside back among those that wait. The number of rows; absent if it
+  // fails, and then nothing has changed.
   std::optional<int64_t> requeue();
-  // Gives up to `pages` pages of free space back to the file system; false when there is none.
+  // Gives up to `pages` pages of free space back to the file system. False if there was none.
   bool shrink(int pages);
 
  private:

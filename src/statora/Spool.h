@@ -1,4 +1,10 @@
-// The spool: its database, and the event sender that fills it.
+// The spool: a durable queue of events in an SQLite database. The service fills it, the forwarder
+// (ForwarderState.h) empties it.
+//
+//   events  one row per event, in the order of sending
+//   meta    facts about this spool; `spool_id` is 32 hexadecimal digits, drawn when it was made
+//
+// The forwarder keeps tables of its own in the same file.
 
 #pragma once
 
@@ -13,46 +19,23 @@
 
 namespace tessel {
 
-// The spool's database: its name, its schema, and the one place where it is opened and upgraded.
-//
-//   events  one row per event, in send order
-//   meta    facts about this spool; `spool_id` is 32 hexadecimal digits drawn when it was made
-//
-// The forwarder keeps tables of its own in the same file; see ForwarderState.h among the tools.
-
 inline constexpr char kSpoolFileName[] = "statora.db";
 inline constexpr int kSpoolSchemaVersion = 1;
 
-// Opens the spool at `path`, makes it where there is none, and brings it up to this schema version.
-// Fails with SQLITE_SCHEMA where it was made by a newer version; nothing in it is changed then.
+// Opens the spool at `path`, makes it if there is none, and brings an older one up to this schema
+// version. Fails with SQLITE_SCHEMA, and changes nothing, if a newer version made it. This is the
+// one place where a spool is made or upgraded.
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds);
 
-// Spool: the analytics service's event sender, a durable queue in an SQLite database.
-//
-// Every send commits one row and flushes the write-ahead log (synchronous=FULL), so that a row is
-// in the file, past a power cut, when its own send has returned. A flush for every second send
-// would do for what is promised; it is not worth its bookkeeping. With its flush a send takes about
-// 0.1 ms on flash, half of it processor time, and at the service's pace of 80 sends a second even a
-// disk that needs 10 ms for each keeps up. And the last row of a run is as safe as every other.
-//
-// The database is opened by the first send, so a run that sends nothing leaves nothing behind. It
-// is closed at the end of a run: a database that was moved or removed meanwhile is noticed then.
-//
-// A send that fails is counted under its reason and said once per run and reason in the log; the
-// event is gone and the run goes on. A database that turns out damaged is set aside, with its
-// write-ahead log, under `statora.db.damaged-<UTC date>`, once a run at most, and a new one is
-// begun. What was stored is never rewritten.
-//
-// Threads: one at a time, the reporting queue's.
-
+// Why a send failed.
 enum class SpoolFailure {
   limit,     // the spool holds as much as it may
-  diskFull,  // no space, no quota
-  readOnly,  // not to be written, or not to be opened
+  diskFull,  // no space or no quota is left
+  readOnly,  // the file cannot be opened or written
   locked,    // another client keeps it locked
-  damaged,   // and could not be set aside, or was so already in this run
-  version,   // made by another version of the schema
+  damaged,   // and could not be set aside, or one was set aside already in this run
+  version,   // another version of the schema made it
   other,
 };
 inline constexpr size_t kSpoolFailureKinds = 7;
@@ -60,27 +43,39 @@ inline constexpr size_t kSpoolFailureKinds = 7;
 // "limit", "disk_full", "read_only", "locked", "damaged", "version", "other".
 const char* spoolFailureName(SpoolFailure failure);
 
-// What became of the sends since the run began.
+// What became of the sends since the run began: each is either stored or has failed for one reason.
 struct SpoolFigures {
+  uint64_t sent = 0;
   uint64_t stored = 0;
   std::array<uint64_t, kSpoolFailureKinds> failed{};  // by SpoolFailure
-  std::vector<std::string> setAside;                  // names that damaged databases were given
+  std::vector<std::string> setAside;                  // file names of damaged spools
 };
 
+// The event sender of the analytics service.
+//
+// A row is past a power cut as soon as its own sendEvent() has returned true. The first send opens
+// the database, so a run that sends nothing leaves no file. endRun() closes it, so the next run
+// notices that somebody moved or removed it.
+//
+// A send that fails is counted under its reason and the run goes on; the log says each reason once
+// a run. A damaged spool is renamed to `statora.db.damaged-<UTC date>`, at most once a run, and a
+// new one is begun. Nothing ever rewrites what was stored.
+//
+// Threads: one at a time (the reporting queue).
 class Spool final : public EventSender {
  public:
   static constexpr uint64_t kDefaultMaxBytes = uint64_t{1} << 30;
 
-  // Keeps its database in `stateDirectory`, which is made when it is first needed. `maxBytes`
-  // bounds database and write-ahead log together; a sixteenth of it is for the log.
+  // The database lies in `stateDirectory`, which the first send makes. `maxBytes` bounds the
+  // database and its write-ahead log together; a sixteenth of it is for the log.
   Spool(std::string stateDirectory, Clock& clock, uint64_t maxBytes = kDefaultMaxBytes);
 
   bool sendEvent(std::string_view name, const Payload& payload) override;
 
-  // Sets the figures to zero and forgets what was said in the log.
+  // Sets the figures to zero. The log may then say each reason again.
   void beginRun();
   const SpoolFigures& figures() const { return figures_; }
-  // Closes the database.
+  // Closes the database, which moves the write-ahead log into it.
   void endRun();
 
  private:
@@ -101,10 +96,10 @@ class Spool final : public EventSender {
 
   SqliteDatabase database_;
   SqliteStatement insert_;
-  int64_t maxPages_ = 0;
+  int64_t maxPages_ = 0;  // of the database; 0 until it was opened
   int64_t maxLogPages_ = 0;
   int64_t logPages_ = 0;    // in the write-ahead log, after the last commit
-  bool impatient_ = false;  // the last wait for a lock was in vain
+  bool impatient_ = false;  // the last wait for a lock was in vain, so the next send does not wait
   SpoolFigures figures_;
 };
 

@@ -1,4 +1,7 @@
 // SQLite with its errors as values.
+//
+// A thin layer: it owns handles and statements and turns codes into SqliteStatus. SQL stands where
+// it is used, because the spool's statements are few and their meaning lies in their order.
 
 #include "statora/Sqlite.h"
 
@@ -19,7 +22,7 @@ SqliteStatement& SqliteStatement::bind(int parameter, int64_t value) {
 }
 
 SqliteStatement& SqliteStatement::bind(int parameter, std::string_view text) {
-  // A null pointer would bind NULL instead of an empty text.
+  // An empty view may hold a null pointer, which SQLite would bind as NULL instead of as ''.
   const char* bytes = text.empty() ? "" : text.data();
   sqlite3_bind_text64(statement_.get(), parameter, bytes, text.size(), SQLITE_STATIC, SQLITE_UTF8);
   return *this;
@@ -41,7 +44,8 @@ void SqliteStatement::reset() { sqlite3_reset(statement_.get()); }
 bool SqliteStatement::run() {
   Step result = step();
   while (result == Step::row) result = step();
-  // A reset reports the failure of the step again, so that status() still tells it.
+  // A statement that is not reset would keep its transaction, and with it the lock. The reset
+  // reports the failure of the step again, so status() still has the reason.
   reset();
   return result == Step::done;
 }
@@ -58,6 +62,7 @@ std::string_view SqliteStatement::text(int column) const {
 
 namespace {
 
+// Only a URI can say "immutable". In a path these three characters would have a meaning in it.
 std::string immutableUri(const std::string& path) {
   std::string uri = "file:";
   for (const char character : path) {
@@ -78,6 +83,7 @@ std::string immutableUri(const std::string& path) {
 
 SqliteStatus SqliteDatabase::open(const std::string& path, Mode mode) {
   close();
+  // No mutex: one thread at a time uses a database.
   int flags = SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE;
   if (mode == Mode::readOnly) flags |= SQLITE_OPEN_READONLY;
   if (mode == Mode::readWrite) flags |= SQLITE_OPEN_READWRITE;
@@ -87,6 +93,7 @@ SqliteStatus SqliteDatabase::open(const std::string& path, Mode mode) {
   const std::string name = immutable ? immutableUri(path) : path;
   const int code = sqlite3_open_v2(name.c_str(), &handle_, flags, nullptr);
   if (code == SQLITE_OK) return {};
+  // A failed open leaves a handle, which holds the reason and must be closed all the same.
   SqliteStatus failure = status();
   failure.code = code;
   close();
@@ -127,9 +134,11 @@ std::optional<std::string> SqliteDatabase::text(std::string_view query) {
 }
 
 SqliteStatus SqliteDatabase::status() const {
+  // SQLite answers without a handle only if it cannot allocate one.
   if (handle_ == nullptr) return {SQLITE_NOMEM, "out of memory"};
   const int code = sqlite3_extended_errcode(handle_);
   if (code == SQLITE_OK || code == SQLITE_ROW || code == SQLITE_DONE) return {};
+  // "disk I/O error" alone helps nobody, so the system's own words follow.
   std::string reason = sqlite3_errmsg(handle_);
   if (const int systemError = sqlite3_system_errno(handle_); systemError != 0) {
     reason.append(" (").append(std::strerror(systemError)).append(")");

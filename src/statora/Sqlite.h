@@ -1,7 +1,7 @@
-// SqliteDatabase and SqliteStatement: SQLite with its errors as values.
+// SQLite with its errors as values.
 //
-// Threads: a database and its statements are used by one thread at a time. Statements must be gone
-// before their database is closed.
+// Threads: one thread at a time uses a database and its statements. Statements go before their
+// database is closed.
 
 #pragma once
 
@@ -16,8 +16,8 @@ struct sqlite3_stmt;
 
 namespace tessel {
 
-// What an operation came to: SQLite's extended result code, and where it failed the reason in
-// words.
+// How an operation ended: SQLite's extended result code (0: well), and the reason in words if it
+// failed.
 struct SqliteStatus {
   int code = 0;
   std::string reason;
@@ -34,13 +34,13 @@ class SqliteStatement {
   SqliteStatement() = default;
   bool prepared() const { return statement_ != nullptr; }
 
-  // Parameters count from 1. Text and blobs are borrowed until reset().
+  // Parameters count from 1. Text is borrowed until reset(), not copied.
   SqliteStatement& bind(int parameter, int64_t value);
   SqliteStatement& bind(int parameter, std::string_view text);
   Step step();
-  // Ends the execution; the parameters stay bound and must be bound anew before the next one.
+  // Ends the execution. Bind every parameter anew before the next one.
   void reset();
-  // One whole execution of a statement that yields no rows of interest.
+  // Executes the statement from beginning to end and drops its rows. False if it failed.
   bool run();
 
   // Columns count from 0. Text is valid until the next step() or reset().
@@ -57,8 +57,8 @@ class SqliteStatement {
 
 class SqliteDatabase {
  public:
-  // immutable: read as it stands, with no look at a write-ahead log and without the files that
-  // other modes make beside it; for one who may only read, while nobody writes.
+  // `immutable` reads the file as it stands, without its write-ahead log, and makes no files beside
+  // it. It is for a user who may only read, while nobody writes.
   enum class Mode { readOnly, readWrite, create, immutable };
 
   SqliteDatabase() = default;
@@ -69,14 +69,15 @@ class SqliteDatabase {
   SqliteStatus open(const std::string& path, Mode mode);
   bool isOpen() const { return handle_ != nullptr; }
   void close();
-  // Closes and leaves every file as it is: nothing is moved from the write-ahead log.
+  // Closes without a checkpoint, so that every file stays as it is.
   void abandon();
 
-  // Runs statements that yield no rows of interest.
+  // Runs several statements and drops their rows.
   SqliteStatus execute(const std::string& statements);
-  // Not prepared() where it failed: see status().
+  // prepared() is false if this fails; status() then says why. `keptForLong` tells SQLite that the
+  // statement will run many times.
   SqliteStatement prepare(std::string_view text, bool keptForLong = false);
-  // The first column of the first row; nothing where there is none or it failed.
+  // The first column of the first row. Absent if there is no row or the query failed.
   std::optional<int64_t> integer(std::string_view query);
   std::optional<std::string> text(std::string_view query);
 
@@ -84,6 +85,7 @@ class SqliteDatabase {
   SqliteStatus status() const;
   // How long an operation may wait for another client's lock.
   void setBusyTimeout(int milliseconds);
+  // The rows that the last INSERT or DELETE changed.
   int64_t changes() const;
   sqlite3* handle() const { return handle_; }
 
