@@ -17,11 +17,11 @@ namespace tessel {
 class EventSender {
  public:
   virtual ~EventSender() = default;
-  // Sends one event; false where it was not taken. Called on the reporting queue only.
+  // Sends one event. False if it was not taken. Called on the reporting queue only.
   virtual bool sendEvent(std::string_view name, const Payload& payload) = 0;
 };
 
-// A value of a configuration: nothing (JSON's null), a number, a string, a list or a dictionary.
+// A value of a configuration: null, a number, a string, a list or a dictionary.
 struct ConfigurationValue {
   using List = std::vector<ConfigurationValue>;
   using Dictionary = std::map<std::string, ConfigurationValue, std::less<>>;
@@ -33,14 +33,15 @@ class ConfigurationObserver;
 class ConfigurationObserverDelegate {
  public:
   virtual ~ConfigurationObserverDelegate() = default;
-  // `configuration` is null where it is absent.
+  // `configuration` is null if it is absent.
   virtual void observerDidChangeConfiguration(
       ConfigurationObserver& observer,
       const std::shared_ptr<const ConfigurationValue>& configuration, const std::string& type) = 0;
 };
 
-// Calls its delegate on its queue, at any time after observing began, any number of times. It
-// keeps the delegate; calls may still be under way when the last reference to it is dropped.
+// Calls its delegate on its queue, at any time after observing began and any number of times. The
+// observer keeps the delegate alive. A call may still be under way when the last reference to the
+// observer is dropped.
 class ConfigurationObserver {
  public:
   virtual ~ConfigurationObserver() = default;

@@ -1,4 +1,7 @@
-// The installed sink and the process-wide handle.
+// The installed sink, the service's handle, and the formatting of checked texts.
+//
+// The sink is the one global of the program: almost every part logs, and a reference in each
+// constructor would say nothing about that part.
 
 #include "platform/Log.h"
 
@@ -8,6 +11,7 @@ namespace tessel {
 
 void LogArgument::appendTo(std::string& out, std::string_view conversion) const {
   if (const auto* number = std::get_if<double>(&value_)) {
+    // "%f" prints the largest double with 309 digits before the point and 6 behind it.
     char buffer[400];
     const int length = conversion == "%.2f" ? std::snprintf(buffer, sizeof buffer, "%.2f", *number)
                                             : std::snprintf(buffer, sizeof buffer, "%f", *number);
@@ -23,6 +27,7 @@ void LogArgument::appendTo(std::string& out, std::string_view conversion) const 
   }
 }
 
+// No bounds are checked here: LogFormat has counted the conversions when the call was compiled.
 std::string formatLogArguments(std::string_view text,
                                std::initializer_list<LogArgument> arguments) {
   std::string out;
@@ -47,6 +52,7 @@ std::atomic<int> enabledLogLevels{0};
 }
 
 void setLogSink(LogSink* sink, LogLevel level) {
+  // The sink first and the level last: who sees an enabled level also sees its sink.
   installedSink.store(sink, std::memory_order_release);
   detail::enabledLogLevels.store(sink ? static_cast<int>(level) + 1 : 0, std::memory_order_release);
 }

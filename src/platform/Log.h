@@ -1,9 +1,10 @@
-// The system log: levels, the sink behind it, and the one ambient handle, tesselReporterLog().
+// The system log: message texts that the compiler checks, levels, the sink behind them, and the
+// service's handle, tesselReporterLog().
 //
-// Message texts are given as they stand, with %@ for a string or a thing with a description(), and
-// %llu %lu (unsigned 64-bit), %ld (signed 64-bit), %u (unsigned 32-bit), %f %.2f (floating point),
-// %s (text). They are checked against the arguments when the call is compiled and formatted only
-// where the level is enabled.
+// The conversions of a text are %@ (a string or a thing with a description()), %s (text), %llu and
+// %lu (unsigned 64-bit), %ld (signed 64-bit), %u (unsigned 32-bit), %f and %.2f (floating point). A
+// call whose arguments do not fit its text does not compile. A text is formatted only if its level
+// is enabled.
 //
 // Threads: any. The sink is installed once, before the first thread starts, and never removed.
 
@@ -21,8 +22,6 @@
 #include "platform/SharedString.h"
 
 namespace tessel {
-
-// LogFormat: a message text that is checked against its arguments when it is compiled.
 
 namespace detail {
 
@@ -54,7 +53,8 @@ consteval LogArgumentKind kindOf() {
 
 struct LogConversion {
   LogArgumentKind kind;
-  size_t length;  // of the conversion, the percent sign included; 0 where it is none that is known
+  size_t length;  // of the conversion, the percent sign included; 0 if it is not one of those that
+                  // are known
 };
 
 constexpr LogConversion conversionAt(std::string_view rest) {
@@ -75,7 +75,8 @@ constexpr LogConversion conversionAt(std::string_view rest) {
 
 }  // namespace detail
 
-// A message text whose conversions fit `Args`, in number and kind; anything else does not compile.
+// A message text whose conversions fit `Args` in number and kind. Anything else does not compile,
+// because a consteval function may not throw.
 template <typename... Args>
 class LogFormat {
  public:
@@ -133,18 +134,9 @@ std::string formatLog(std::string_view text, Args&&... arguments) {
   return formatLogArguments(text, {std::forward<Args>(arguments)...});
 }
 
-// The system log: levels, the sink behind it, and the one ambient handle, tesselReporterLog().
-//
-// Message texts are given as they stand, with %@ for a string or a thing with a description(), and
-// %llu %lu (unsigned 64-bit), %ld (signed 64-bit), %u (unsigned 32-bit), %f %.2f (floating point),
-// %s (text). They are checked against the arguments when the call is compiled and formatted only
-// where the level is enabled.
-//
-// Threads: any. The sink is installed once, before the first thread starts, and never removed.
-
 enum class LogLevel { error = 0, debug = 1 };
 
-// Where lines go. write() may be called from any thread at any time.
+// Where lines go. Any thread may call write() at any time.
 class LogSink {
  public:
   virtual ~LogSink() = default;
@@ -152,10 +144,11 @@ class LogSink {
                      std::string_view text) = 0;
 };
 
-// Sends lines up to and including `level` to `sink`; a null sink discards. The sink is not owned
-// and must outlive every thread that logs.
+// Sends the lines of `level` and of more important ones to `sink`. A null sink discards all. The
+// caller keeps the sink until the last thread that logs has ended.
 void setLogSink(LogSink* sink, LogLevel level);
 
+// Names who logs. Each program has one; the category is its name in the log.
 class LogHandle {
  public:
   constexpr LogHandle(std::string_view subsystem, std::string_view category)
@@ -181,11 +174,11 @@ class LogHandle {
   std::string_view category_;
 };
 
-// Subsystem "com.vantor.TesselSupport", category "tessel_reporter".
+// The service's handle: subsystem "com.vantor.TesselSupport", category "tessel_reporter".
 const LogHandle& tesselReporterLog();
 
 namespace detail {
-// One above the highest enabled level; 0 where nothing is enabled.
+// One above the highest enabled level; 0 if nothing is enabled.
 extern std::atomic<int> enabledLogLevels;
 }  // namespace detail
 

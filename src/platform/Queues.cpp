@@ -1,4 +1,19 @@
-// Queues and timers on threads of their own.
+// Queues and timers on threads.
+//
+// Threads exist only while there is work. A queue that gets work takes an idle thread, or a new one
+// if none is idle; a thread that has emptied its queue serves the next, and ends if none comes
+// within a moment. The service has half a dozen queues and sleeps for a day between two runs: a
+// thread for each would cost a stack and a wakeup for nothing. A pool of fixed size was discarded,
+// because a queue may wait for another (sync), and a full pool would then wait for ever.
+//
+// Every thread is detached. To join them at the end, the process would have to wait for closures
+// that may sleep for long (the throttle) or wait for something that will not come.
+//
+// So exit(0) may meet threads that are still running. The C library then destroys the objects with
+// static storage while those threads go on. Whatever they touch (Threads, TimerThread, the sink of
+// the log) is made by `new` and never deleted; a queue's state lives as long as the thread that
+// works on it. An unfinished closure ends with the process, which its work must allow: the spool
+// loses no row by it, and a run leaves its marker.
 
 #include "platform/Queues.h"
 
@@ -12,10 +27,13 @@
 #include <utility>
 #include <vector>
 
+#include "platform/Invariant.h"
+
 namespace tessel {
 
 namespace {
-// Long enough for the next of a row of closures, short enough that idle threads do not add up.
+// An idle thread waits this long for work. A run submits its closures within microseconds of each
+// other, so one thread serves them all; and 20 ms later an idle process has none of them left.
 constexpr std::chrono::milliseconds kIdleThreadLife{20};
 }  // namespace
 
@@ -24,11 +42,12 @@ struct WorkerQueue::State {
 
   const std::string label;
   std::mutex mutex;
-  std::list<Closure> work;  // a list takes nothing from the heap while it is empty
-  bool hasThread = false;   // or is about to have one
+  std::list<Closure> work;  // a list, because an empty one has nothing on the heap
+  bool hasThread = false;   // or will have one soon
+  bool working = false;     // a closure is running
 };
 
-// The threads of all queues. A queue that gets work waits for one that is idle, or gets a new one.
+// The threads of all queues.
 class WorkerQueue::Threads {
  public:
   static Threads& shared() {
@@ -43,8 +62,8 @@ class WorkerQueue::Threads {
       arrived_.notify_one();
       return;
     }
-    // Under the lock, without which the thread cannot end: detach() of the C library still reads
-    // what a thread that ends meanwhile gives back to the system.
+    // Start the thread under the lock, which it needs before it can end. detach() reads the
+    // thread's memory, and a thread that ended before would have given it back already.
     std::thread([this] { run(); }).detach();
   }
 
@@ -97,15 +116,21 @@ void WorkerQueue::sync(const Closure& work) {
   }
 }
 
+// Runs everything that the queue holds. `hasThread` lets only one thread in, and that is what makes
+// the queue serial; each closure is destroyed before the next begins.
 void WorkerQueue::drain(State& state) {
   std::unique_lock lock(state.mutex);
   while (!state.work.empty()) {
     Closure work = std::move(state.work.front());
     state.work.pop_front();
+    // One at a time: the code of the service relies on it in place of locks.
+    TESSEL_INVARIANT(!state.working);
+    state.working = true;
     lock.unlock();
     work();
     work = nullptr;
     lock.lock();
+    state.working = false;
   }
   state.hasThread = false;
 }
@@ -126,7 +151,8 @@ struct Firing {
   bool operator<(const Firing& other) const { return due > other.due; }
 };
 
-// The one thread that submits timer handlers when they are due. Lives as long as the process.
+// The one thread that submits the handlers of all timers when they are due. It never runs a handler
+// itself, so a slow one delays no other timer. It lives as long as the process.
 class TimerThread {
  public:
   static TimerThread& shared() {
@@ -159,7 +185,7 @@ class TimerThread {
         continue;
       }
       firings_.pop();
-      // A firing that could not be kept is not made up for.
+      // After a long sleep of the machine the missed firings are not made up for.
       next.due = std::max(next.due + next.timer->interval, now);
       firings_.push(next);
       lock.unlock();
@@ -193,7 +219,7 @@ std::shared_ptr<SerialQueue> WorkerQueueFactory::makeSerialQueue(std::string lab
 std::shared_ptr<RepeatingTimer> WorkerQueueFactory::makeRepeatingTimer(
     std::shared_ptr<SerialQueue> queue, std::chrono::nanoseconds interval,
     std::chrono::nanoseconds /*leeway*/, Closure handler) {
-  // Firings come on time, which every leeway allows.
+  // The firings come on time, and any leeway allows that.
   return std::make_shared<SharedThreadTimer>(
       std::make_shared<TimerRecord>(TimerRecord{std::move(queue), interval, std::move(handler)}));
 }

@@ -1,5 +1,5 @@
 // Work on queues: the roles SerialQueue, RepeatingTimer and QueueFactory, their implementation on
-// threads, and the semaphore to wait with.
+// threads (standard library alone), and the semaphore to wait with.
 
 #pragma once
 
@@ -13,19 +13,18 @@
 
 namespace tessel {
 
-// Semaphore: a counting semaphore whose wait can time out.
-
+// A counting semaphore whose wait can time out. Any thread.
 class Semaphore {
  public:
   explicit Semaphore(uint64_t count) : count_(count) {}
 
   void signal() {
-    // Notified under the lock: the waiter may destroy the semaphore as soon as it has the lock.
+    // Notify under the lock: as soon as the waiter gets the lock, it may destroy the semaphore.
     const std::lock_guard lock(mutex_);
     ++count_;
     condition_.notify_one();
   }
-  // Takes one unit; false where none came within `timeout`, measured from the call.
+  // Takes one unit. False if none came within `timeout`, measured from the call.
   bool waitFor(std::chrono::nanoseconds timeout) {
     std::unique_lock lock(mutex_);
     if (!condition_.wait_for(lock, timeout, [this] { return count_ > 0; })) return false;
@@ -39,25 +38,25 @@ class Semaphore {
   uint64_t count_;
 };
 
-// SerialQueue and RepeatingTimer: work that runs one piece at a time, in order of submission.
-
 using Closure = std::function<void()>;
 
-// A first-in first-out queue. What is submitted from any thread runs one closure at a time, each
-// after all that was submitted before it. A queue that is dropped still runs what it holds.
+// A first-in first-out queue. Any thread may submit closures. They run one at a time, in the order
+// in which they were submitted. A queue still runs what it holds after its last reference is
+// dropped.
 class SerialQueue {
  public:
   virtual ~SerialQueue() = default;
   virtual const std::string& label() const = 0;
-  // Returns at once; `work` runs later and is destroyed right after it ran.
+  // Returns at once. `work` runs later and is destroyed right after that.
   virtual void async(Closure work) = 0;
-  // Returns when `work` has run. REQUIRES: not called from the queue itself.
+  // Returns after `work` has run. REQUIRES: not called from the queue itself, which would wait for
+  // itself.
   virtual void sync(const Closure& work) = 0;
 };
 
-// A timer that submits its handler to a queue: once when resumed and then every interval. A firing
-// may come up to the leeway late. It goes on for as long as the process lives, also after the last
-// reference to it was dropped.
+// A timer that submits its handler to a queue, once when it is resumed and then every interval. A
+// firing may come late by up to the leeway. The timer goes on for as long as the process lives,
+// even after its last reference is dropped.
 class RepeatingTimer {
  public:
   virtual ~RepeatingTimer() = default;
@@ -76,15 +75,9 @@ class QueueFactory {
                                                              Closure handler) = 0;
 };
 
-// WorkerQueue and WorkerQueueFactory: serial queues and timers on threads, standard library alone.
-//
-// A queue has a thread only while it has work, and an idle queue costs a few hundred bytes. A
-// thread that has emptied its queue takes the next one that has work, and leaves where none comes
-// within a moment; a queue that finds no idle thread gets a new one, so that no queue waits for
-// another. All timers of the process share one thread, which does nothing but submit to queues.
-// Threads are never joined, and what they use is never destroyed, so the process may end at any
-// moment.
-
+// A queue on threads. It has a thread only while it has work, so that an idle queue costs a few
+// hundred bytes. Its threads are never joined, and what they use is never destroyed, so the process
+// may end at any moment; see Queues.cpp.
 class WorkerQueue final : public SerialQueue {
  public:
   explicit WorkerQueue(std::string label);
@@ -101,6 +94,8 @@ class WorkerQueue final : public SerialQueue {
   std::shared_ptr<State> state_;
 };
 
+// Makes queues on threads. All timers of the process share one thread, which only submits to
+// queues.
 class WorkerQueueFactory final : public QueueFactory {
  public:
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;

@@ -13,8 +13,6 @@
 
 namespace tessel {
 
-// The background-activity scheduler as the service uses it.
-
 // Activity states, as the scheduler numbers them.
 inline constexpr int64_t kActivityStateCheckIn = 0;
 inline constexpr int64_t kActivityStateRun = 2;
@@ -27,7 +25,7 @@ class Activity {
   virtual int64_t state() = 0;
   // Whether the scheduler wants the activity to give its slot back.
   virtual bool shouldDefer() = 0;
-  // False where the scheduler did not take the state.
+  // False if the scheduler does not take the state.
   virtual bool setState(int64_t state) = 0;
 };
 
@@ -36,20 +34,18 @@ using ActivityHandler = std::function<void(const std::shared_ptr<Activity>&)>;
 class ActivityScheduler {
  public:
   virtual ~ActivityScheduler() = default;
-  // Registers for check-in; the criteria are those of the launch configuration. The handler is
-  // called on a thread of the scheduler's own, never twice at a time.
+  // Registers for check-in, with the criteria of the launch configuration. The scheduler calls the
+  // handler on a thread of its own, never twice at a time.
   virtual void registerActivity(const std::string& name, ActivityHandler handler) = 0;
 };
 
-// The process runtime: keep-alive transactions, clean exit, signals, the main event loop.
-
-// While one is open the process is not ended as idle. Destroying it closes it.
+// While a transaction is open, the process is not ended as idle. Destroying the object closes it.
 class KeepAliveTransaction {
  public:
   virtual ~KeepAliveTransaction() = default;
 };
 
-// Delivers a signal as a closure on a queue. Made suspended.
+// Delivers a signal as a closure on a queue. It delivers nothing until it is resumed.
 class SignalSource {
  public:
   virtual ~SignalSource() = default;
@@ -61,23 +57,23 @@ class Runtime {
  public:
   virtual ~Runtime() = default;
   virtual std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) = 0;
-  // Lets the process end with status 0 once no transaction is open and no delivery is pending.
+  // Lets the process end with status 0 as soon as no transaction is open and no delivery is
+  // pending.
   virtual void requestCleanExit() = 0;
   virtual std::shared_ptr<SignalSource> makeSignalSource(int signalNumber,
                                                          std::shared_ptr<SerialQueue> queue) = 0;
   [[noreturn]] virtual void runMainLoop() = 0;
 };
 
-// ServiceStatus: tells the service manager what the process is doing and that it gets on.
-
-// Any thread may call.
+// Tells the service manager what the process is doing and that it makes progress. Any thread.
 class ServiceStatus {
  public:
   virtual ~ServiceStatus() = default;
   // What the process is doing now, in a few words for a human: "reading the trace store".
   virtual void say(std::string_view words) = 0;
-  // Work moved on by a step. Cheap enough for every trace object: most calls only read a clock. A
-  // process that works and does not call it for as long as its watchdog allows is taken for hung.
+  // Says that work moved on by a step. Cheap enough for every trace object: most calls only read a
+  // clock. If a process that works does not call it within its watchdog period, the manager takes
+  // the process for hung and kills it.
   virtual void progress() = 0;
 };
 

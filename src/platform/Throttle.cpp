@@ -1,4 +1,8 @@
 // The arithmetic of pacing.
+//
+// The bound protects whoever takes the events: 10 in 125 ms are 80 a second. A quantum is measured
+// from its own beginning and never carries unused time over, so that no burst of more than 10
+// events follows a quiet while.
 
 #include "platform/Throttle.h"
 
@@ -12,6 +16,7 @@ constexpr uint32_t eventsPerQuantum = 10;
 
 void Throttle::setUp() {
   const Timebase timebase = clock_.timebase();
+  // The first step sets up, and not the constructor: the first quantum begins with the first send.
   microsecondsPerMachUnit_ =
       static_cast<double>(timebase.numerator) / static_cast<double>(timebase.denominator) / 1000.0;
   quantumMicroseconds_ = 125000.0f;
@@ -28,11 +33,13 @@ void Throttle::throttleReportedEvent() {
   const uint64_t ticks = clock_.continuousTicks() - quantumStartTime_;
   sleepForRestOfQuantum(static_cast<double>(ticks) * microsecondsPerMachUnit_);
   eventsInQuantum_ = 0;
+  // Read after the sleep, so that the sleep does not count for the next quantum.
   quantumStartTime_ = clock_.continuousTicks();
 }
 
 void Throttle::sleepForRestOfQuantum(double elapsedMicroseconds) {
   const double quantum = static_cast<double>(quantumMicroseconds_);
+  // Written so that a NaN, of a timebase with denominator 0, does not sleep.
   if (!(elapsedMicroseconds < quantum)) return;
   const auto sleep = static_cast<uint32_t>(quantum - elapsedMicroseconds);
   tesselReporterLog().debug("Sleeping for %u us", sleep);

@@ -1,11 +1,10 @@
 // Throttle: paces what is sent to at most 10 events per 125,000 microseconds.
 //
-// Every send is preceded by one throttle step. Each tenth step closes a quantum: where the quantum
-// was shorter than 125,000 microseconds, the step sleeps for the rest. The other nine are an
-// increment and a comparison.
+// Take a step before every send. Each tenth step closes a quantum and sleeps for what is left of
+// its 125,000 microseconds. The other nine cost an increment and a comparison.
 //
-// One object serves the whole process, and its counters carry over from run to run. Threads: one
-// at a time; callers follow one another, so there is no lock.
+// One object serves the whole process, and its counters go on from run to run. Threads: one at a
+// time. Callers follow one another, so it has no lock.
 
 #pragma once
 
@@ -20,7 +19,7 @@ class Throttle {
  public:
   explicit Throttle(Clock& clock) : clock_(clock) {}
 
-  // One step; sleeps on the caller's thread where the sends go too fast.
+  // Takes one step. Sleeps on the caller's thread if the sends go too fast.
   void throttleReportedEvent();
 
   // Number of sleeps so far.
