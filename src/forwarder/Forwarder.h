@@ -20,7 +20,6 @@
 #include "forwarder/Policy.h"
 #include "platform/Log.h"
 #include "platform/Queues.h"
-#include "platform/Service.h"
 #include "platform/System.h"
 #include "statora/ForwarderState.h"
 

@@ -11,7 +11,6 @@
 #include "linux/LaunchConfiguration.h"
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
-#include "platform/Service.h"
 #include "platform/System.h"
 
 namespace tessel {

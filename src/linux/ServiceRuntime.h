@@ -10,7 +10,6 @@
 #include <mutex>
 #include <string>
 
-#include "platform/Service.h"
 #include "platform/System.h"
 
 namespace tessel {

@@ -7,10 +7,17 @@
 
 #pragma once
 
+#include <cstdio>
+#include <cstdlib>
+
 namespace tessel {
 
 // Says on standard error what does not hold and where, and aborts.
-[[noreturn]] void invariantBroken(const char* condition, const char* file, int line);
+[[noreturn]] inline void invariantBroken(const char* condition, const char* file, int line) {
+  // Not through the log: its sink may be what is broken.
+  std::fprintf(stderr, "error: broken invariant at %s:%d: %s\n", file, line, condition);
+  std::abort();
+}
 
 }  // namespace tessel
 

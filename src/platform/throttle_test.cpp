@@ -1,6 +1,6 @@
 // Pacing by the fake clock.
 
-#include "platform/Throttle.h"
+#include "platform/Analytics.h"
 
 #include <gtest/gtest.h>
 

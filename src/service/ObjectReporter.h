@@ -15,7 +15,6 @@
 #include "objects/TesselObject.h"
 #include "platform/Analytics.h"
 #include "platform/Queues.h"
-#include "platform/Throttle.h"
 
 namespace tessel {
 

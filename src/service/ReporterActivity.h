@@ -4,7 +4,7 @@
 
 #include <memory>
 
-#include "platform/Service.h"
+#include "platform/System.h"
 #include "service/ReportingRun.h"
 
 namespace tessel {

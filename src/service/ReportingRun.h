@@ -15,7 +15,6 @@
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Queues.h"
-#include "platform/Service.h"
 #include "platform/System.h"
 #include "service/CookieFile.h"
 #include "service/ObjectReporter.h"

@@ -7,7 +7,6 @@
 
 #include "filter/TesselReporterAggregation.h"
 #include "platform/Analytics.h"
-#include "platform/Throttle.h"
 
 namespace tessel {
 

@@ -14,9 +14,7 @@
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Analytics.h"
-#include "platform/Service.h"
 #include "platform/System.h"
-#include "platform/Throttle.h"
 
 namespace tessel {
 

@@ -14,7 +14,7 @@
 
 #include "journal/EntryStream.h"
 #include "objects/TesselSupportObjectExtractor.h"
-#include "platform/Service.h"
+#include "platform/System.h"
 #include "trace/ExtractionReport.h"
 #include "trace/IntervalAssembler.h"
 #include "trace/PairLimit.h"

@@ -13,7 +13,6 @@
 #include "platform/Analytics.h"
 #include "platform/Log.h"
 #include "platform/Queues.h"
-#include "platform/Service.h"
 #include "platform/System.h"
 
 namespace tessel::testing {

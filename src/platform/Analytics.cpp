@@ -1,10 +1,10 @@
-// The arithmetic of pacing.
+// The arithmetic of pacing: Throttle, the one part of Analytics.h with a body.
 //
 // The bound protects whoever takes the events: 10 in 125 ms are 80 a second. A quantum is measured
 // from its own beginning and never carries unused time over, so that no burst of more than 10
 // events follows a quiet while.
 
-#include "platform/Throttle.h"
+#include "platform/Analytics.h"
 
 #include "platform/Log.h"
 
