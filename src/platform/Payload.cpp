@@ -2,8 +2,6 @@
 
 #include "platform/Payload.h"
 
-#include "platform/Json.h"
-
 namespace tessel {
 
 bool booleanValue(const Number& number) {
@@ -41,9 +39,9 @@ const Payload::Value* Payload::find(std::string_view key) const {
   return nullptr;
 }
 
-std::string payloadJson(const Payload& payload) {
+std::string payloadJson(const Payload& payload, JsonStyle style) {
   std::string out;
-  JsonWriter json(out);
+  JsonWriter json(out, style);
   json.object([&] {
     for (const auto& [key, value] : payload.entries()) json.member(key, value);
   });

@@ -11,6 +11,7 @@
 #include <variant>
 #include <vector>
 
+#include "platform/Json.h"
 #include "platform/SharedString.h"
 
 namespace tessel {
@@ -45,8 +46,8 @@ class Payload {
   std::vector<Entry> entries_;
 };
 
-// The payload as one JSON object on one line, keys in payload order. Bytes of a string that are not
+// The payload as one JSON object, keys in payload order. Bytes of a string that are not
 // valid UTF-8 become U+FFFD, one for each maximal invalid part.
-std::string payloadJson(const Payload& payload);
+std::string payloadJson(const Payload& payload, JsonStyle style = {});
 
 }  // namespace tessel

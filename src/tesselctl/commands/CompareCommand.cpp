@@ -9,11 +9,11 @@
 #include <tuple>
 
 #include "linux/SystemFacts.h"
+#include "platform/Text.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
-#include "tesselctl/showing/Progress.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/SummaryOutput.h"
+#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -199,35 +199,25 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
   }
 }
 
-void writeChange(std::string& out, const std::pair<Change, uint64_t>& counted) {
-  const Change& change = counted.first;
-  JsonObject object(out);
-  object.text("change", change.starts ? "start" : "stop")
-      .text("subsystem", std::string_view(change.subsystem))
-      .text("category", std::string_view(change.category))
-      .text("name", std::string_view(change.name))
-      .count("count", counted.second)
-      .text("rule", std::string_view(change.why));
-  if (change.slot != 0)
-    object.count("slot", change.slot).text("value", std::string_view(change.value));
-  object.end();
+void writeChange(JsonWriter& json, const Change& change, uint64_t count) {
+  json.object([&] {
+    json.member("change", change.starts ? "start" : "stop");
+    json.member("subsystem", change.subsystem).member("category", change.category);
+    json.member("name", change.name).member("count", count).member("rule", change.why);
+    if (change.slot != 0) json.member("slot", change.slot).member("value", change.value);
+  });
 }
 
 std::string comparisonJson(const Comparison& comparison) {
-  std::string out;
-  JsonObject object(out);
-  for (size_t side = 0; side < 2; ++side) {
-    object.nested(side == 0 ? "a" : "b", [&](std::string& inner) {
-      JsonObject counts(inner);
-      addVerdicts(counts, comparison.sides[side]);
-      counts.end();
-    });
-  }
-  object.count("starts", comparison.changes.starting())
-      .count("stops", comparison.changes.stopping());
-  object.array("changes", comparison.changes.listed(), writeChange);
-  object.count("changes_not_listed", comparison.changes.notListed()).end();
-  return out + "\n";
+  return objectLine([&](JsonWriter& json) {
+    json.object("a", [&] { addVerdicts(json, comparison.sides[0]); });
+    json.object("b", [&] { addVerdicts(json, comparison.sides[1]); });
+    json.member("starts", comparison.changes.starting());
+    json.member("stops", comparison.changes.stopping());
+    json.array("changes", comparison.changes.listed(),
+               [&](const auto& counted) { writeChange(json, counted.first, counted.second); });
+    json.member("changes_not_listed", comparison.changes.notListed());
+  });
 }
 
 std::string comparisonText(const Comparison& comparison, const CompareOptions& options) {

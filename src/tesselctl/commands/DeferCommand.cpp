@@ -12,7 +12,6 @@
 #include "os/Files.h"
 #include "os/UniqueFd.h"
 #include "tesselctl/commands/Environment.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -21,13 +20,9 @@ namespace {
 
 int sayState(bool json, bool wanted, bool changed, const std::string& file) {
   if (json) {
-    std::string line;
-    JsonObject(line)
-        .boolean("defer", wanted)
-        .boolean("changed", changed)
-        .text("file", std::string_view(file))
-        .end();
-    print(line + "\n");
+    print(objectLine([&](JsonWriter& writer) {
+      writer.member("defer", wanted).member("changed", changed).member("file", file);
+    }));
   } else if (wanted) {
     print(changed ? "Runs are put off from now on; a run under way ends within 10 seconds.\n"
                   : "Runs were put off already.\n");

@@ -5,8 +5,8 @@
 #include <cerrno>
 
 #include "os/Files.h"
+#include "platform/Text.h"
 #include "tesselctl/commands/Commands.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {

@@ -11,11 +11,10 @@
 #include <thread>
 
 #include "linux/SystemFacts.h"
+#include "platform/Text.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/reading/SpoolReader.h"
-#include "tesselctl/showing/JsonLine.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -73,16 +72,13 @@ class RowSelection {
 };
 
 std::string jsonLine(const SpoolRow& row) {
-  std::string line;
-  JsonObject object(line);
-  object.number("id", Number{row.id}).number("time", Number{row.time}).text("name", row.name);
-  if (Json::accept(row.payload)) {
-    object.raw("payload", terminalJson(replaceInvalidUtf8(row.payload)));
-  } else {
-    object.text("payload_text", row.payload);
-  }
-  object.end();
-  return line + "\n";
+  return objectLine([&](JsonWriter& json) {
+    json.member("id", row.id).member("time", row.time).member("name", row.name);
+    if (Json::accept(row.payload))
+      json.rawMember("payload", replaceInvalidUtf8(row.payload));
+    else
+      json.member("payload_text", row.payload);
+  });
 }
 
 // The payload's values beside their keys, for a glance; the rest of it is for --json.

@@ -11,13 +11,13 @@
 #include "journal/EntryStream.h"
 #include "linux/AppBundles.h"
 #include "linux/SystemFacts.h"
+#include "platform/Text.h"
 #include "service/BootVolume.h"
 #include "service/ObjectReporter.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
-#include "tesselctl/showing/Progress.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/SummaryOutput.h"
+#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -72,7 +72,7 @@ class PayloadBuilder {
   // Empty where nothing would be sent.
   std::string json(const TesselObject& object) {
     const std::optional<Payload> payload = reportPayload(object, identity_, bootVolume_);
-    return payload ? terminalJson(payloadJson(*payload)) : "";
+    return payload ? payloadJson(*payload, {.forTerminal = true}) : "";
   }
 
  private:
@@ -93,20 +93,17 @@ struct Explanation {
 
 std::string explanationJson(const Explanation& explanation) {
   const auto& [object, entry, decision, scope, payload] = explanation;
-  std::string line;
-  JsonObject json(line);
-  json.count("classification", decision.classification)
-      .text("verdict", verdictName(decision.classification))
-      .text("kind", object.tesselType())
-      .count("time", entry.realtime)
-      .text("subsystem", object.subsystem())
-      .text("category", object.category())
-      .text("name", object.name());
-  if (const std::string rule = ruleJson(decision, scope); !rule.empty()) json.raw("rule", rule);
-  json.text("cursor", std::string_view(cursorOf(entry)));
-  if (!payload.empty()) json.raw("payload", payload);
-  json.end();
-  return line + "\n";
+  return objectLine([&, &object = object, &entry = entry, &decision = decision, &scope = scope,
+                     &payload = payload](JsonWriter& json) {
+    json.member("classification", decision.classification);
+    json.member("verdict", verdictName(decision.classification));
+    json.member("kind", object.tesselType()).member("time", entry.realtime);
+    json.member("subsystem", object.subsystem()).member("category", object.category());
+    json.member("name", object.name());
+    addRule(json, decision, scope);
+    json.member("cursor", cursorOf(entry));
+    if (!payload.empty()) json.rawMember("payload", payload);
+  });
 }
 
 constexpr size_t kNameWidth = 60;     // columns of a subsystem, category or name
@@ -222,7 +219,7 @@ class ExplainRun {
     bar.clear();
     if (error) return failToRead(error->words, reading_.store);
     if (options_.summary) {
-      print(options_.json ? summaryJson(tally_, run_.report()) + "\n"
+      print(options_.json ? summaryJson(tally_, run_.report())
                           : summaryText(tally_, run_.report(), terminal_));
     } else if (!options_.json) {
       print(closingLine());

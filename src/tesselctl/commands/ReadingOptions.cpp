@@ -6,8 +6,8 @@
 
 #include "linux/SystemFacts.h"
 #include "os/Files.h"
+#include "platform/Text.h"
 #include "tasking/TaskingGate.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {

@@ -11,8 +11,7 @@
 #include "os/DurableFile.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/showing/HtmlReport.h"
-#include "tesselctl/showing/Progress.h"
-#include "tesselctl/showing/ShownText.h"
+#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 

@@ -8,13 +8,12 @@
 #include <nlohmann/json.hpp>
 
 #include "os/Files.h"
+#include "platform/Text.h"
 #include "service/CookieFile.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/reading/TimeArguments.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Losses.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/SummaryOutput.h"
 #include "tesselctl/showing/Terminal.h"
 
@@ -22,103 +21,72 @@ namespace tessel::ctl {
 
 namespace {
 
-void addDate(JsonObject& object, std::string_view key, std::optional<Date> date) {
-  if (date) object.number(key, Number{int64_t{date->time_since_epoch().count()}});
-}
-
-void writeRun(std::string& out, const RunRecord& run, bool hasBooks) {
-  JsonObject object(out);
-  addDate(object, "start", run.start);
-  addDate(object, "end", run.end);
-  object.text("outcome", std::string_view(runOutcomeName(run.outcome)));
-  if (!run.failure.empty()) object.text("failure", std::string_view(run.failure));
-  object.count("log_events", run.logEvents).count("inspected", run.inspected);
-  addVerdicts(object, run.classified);
-  object.count("unnamed", run.unnamed).count("count_events", run.countEvents);
-  object.count("rows_stored", run.rowsStored)
-      .count("rows_expected", hasBooks ? run.rowsExpected() : 0);
-  object.nested("rows_failed", [&](std::string& inner) {
-    JsonObject failed(inner);
-    for (const auto& [reason, count] : run.rowsFailed) failed.count(reason, count);
-    failed.end();
+void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
+  json.member("start", run.start).member("end", run.end);
+  json.member("outcome", runOutcomeName(run.outcome));
+  if (!run.failure.empty()) json.member("failure", run.failure);
+  json.member("log_events", run.logEvents).member("inspected", run.inspected);
+  addVerdicts(json, run.classified);
+  json.member("unnamed", run.unnamed).member("count_events", run.countEvents);
+  json.member("rows_stored", run.rowsStored);
+  json.member("rows_expected", hasBooks ? run.rowsExpected() : 0);
+  json.object("rows_failed", [&] {
+    for (const auto& [reason, count] : run.rowsFailed) json.member(reason, count);
   });
-  if (hasBooks)
-    object.boolean("objects_balance", run.objectsBalance())
-        .boolean("rows_balance", run.rowsBalance());
-  if (run.reading) object.raw("reading", terminalJson(jsonLine(digestJson(*run.reading))));
-  object.end();
-}
-
-void writeSpool(std::string& out, const ReporterStatus& status) {
-  static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
-  JsonObject object(out);
-  object.text("state", kStates[static_cast<size_t>(status.spoolState)]);
-  if (status.spoolState == SpoolReader::State::open) {
-    object.number("rows", Number{status.spool.rows}).count("bytes", status.spool.bytes);
-    if (status.spool.oldest) object.number("oldest", Number{*status.spool.oldest});
-    if (status.spool.newest) object.number("newest", Number{*status.spool.newest});
-  } else {
-    object.text("reason", std::string_view(status.spoolFailure));
+  if (hasBooks) {
+    json.member("objects_balance", run.objectsBalance());
+    json.member("rows_balance", run.rowsBalance());
   }
-  object.end();
+  if (run.reading) json.rawMember("reading", jsonLine(digestJson(*run.reading)));
 }
 
-void writeForwarder(std::string& out, const ForwarderCounters& counters) {
-  JsonObject object(out);
-  object.count("delivered", counters.delivered).count("rejected", counters.rejected);
-  object.count("set_aside", counters.setAside).count("set_aside_dropped", counters.setAsideDropped);
-  object.count("requests", counters.requests).count("retries", counters.retries);
-  object.count("bytes_sent", counters.bytesSent).count("position", counters.position);
-  object.count("last_success", counters.lastSuccess);
-  object.end();
+void writeSpool(JsonWriter& json, const ReporterStatus& status) {
+  static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
+  json.member("state", kStates[static_cast<size_t>(status.spoolState)]);
+  if (status.spoolState == SpoolReader::State::open) {
+    json.member("rows", status.spool.rows).member("bytes", status.spool.bytes);
+    json.member("oldest", status.spool.oldest).member("newest", status.spool.newest);
+  } else {
+    json.member("reason", status.spoolFailure);
+  }
+}
+
+void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
+  json.member("delivered", counters.delivered).member("rejected", counters.rejected);
+  json.member("set_aside", counters.setAside);
+  json.member("set_aside_dropped", counters.setAsideDropped);
+  json.member("requests", counters.requests).member("retries", counters.retries);
+  json.member("bytes_sent", counters.bytesSent).member("position", counters.position);
+  json.member("last_success", counters.lastSuccess);
 }
 
 std::string statusJson(const ReporterStatus& status) {
-  std::string out;
-  JsonObject object(out);
-  object.boolean("good", status.good());
-  object.nested("tasking", [&](std::string& inner) {
-    JsonObject(inner)
-        .boolean("tasked", status.tasking.on)
-        .text("source", taskingSourceName(status.tasking.source))
-        .text("file", std::string_view(status.tasking.file))
-        .end();
+  return objectLine([&](JsonWriter& json) {
+    json.member("good", status.good());
+    json.object("tasking", [&] {
+      json.member("tasked", status.tasking.on);
+      json.member("source", taskingSourceName(status.tasking.source));
+      json.member("file", status.tasking.file);
+    });
+    json.object("deferral", [&] {
+      json.member("wanted", status.deferral.has_value()).member("reason", status.deferral);
+    });
+    json.object("marker", [&] {
+      json.member("present", status.marker.present);
+      if (status.marker.present)
+        json.member("owner", status.marker.owner).member("since", status.marker.since);
+    });
+    if (status.run)
+      json.object("last_run", [&] { writeRun(json, *status.run, status.hasBooks()); });
+    json.member("last_begin", status.lastBegin);
+    json.object("spool", [&] { writeSpool(json, status); });
+    if (status.spool.forwarder)
+      json.object("forwarder", [&] { writeForwarder(json, *status.spool.forwarder); });
+    json.object("journal", [&] {
+      json.member("oldest", status.journal.oldest).member("keeps_a_day", status.keepsADay());
+      if (!status.journal.failure.empty()) json.member("failure", status.journal.failure);
+    });
   });
-  object.nested("deferral", [&](std::string& inner) {
-    JsonObject deferral(inner);
-    deferral.boolean("wanted", status.deferral.has_value());
-    if (status.deferral) deferral.text("reason", std::string_view(*status.deferral));
-    deferral.end();
-  });
-  object.nested("marker", [&](std::string& inner) {
-    JsonObject marker(inner);
-    marker.boolean("present", status.marker.present);
-    if (status.marker.present) {
-      marker.text("owner", std::string_view(status.marker.owner));
-      addDate(marker, "since", status.marker.since);
-    }
-    marker.end();
-  });
-  if (status.run) {
-    object.nested("last_run",
-                  [&](std::string& inner) { writeRun(inner, *status.run, status.hasBooks()); });
-  }
-  addDate(object, "last_begin", status.lastBegin);
-  object.nested("spool", [&](std::string& inner) { writeSpool(inner, status); });
-  if (status.spool.forwarder) {
-    object.nested("forwarder",
-                  [&](std::string& inner) { writeForwarder(inner, *status.spool.forwarder); });
-  }
-  object.nested("journal", [&](std::string& inner) {
-    JsonObject journal(inner);
-    addDate(journal, "oldest", status.journal.oldest);
-    journal.boolean("keeps_a_day", status.keepsADay());
-    if (!status.journal.failure.empty())
-      journal.text("failure", std::string_view(status.journal.failure));
-    journal.end();
-  });
-  object.end();
-  return out + "\n";
 }
 
 // One screen for a human.

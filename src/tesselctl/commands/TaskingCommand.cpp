@@ -7,12 +7,11 @@
 
 #include "os/DurableFile.h"
 #include "os/Files.h"
+#include "platform/Text.h"
 #include "statora/ConfigurationFiles.h"
 #include "tasking/TaskingGate.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/judging/Tasking.h"
-#include "tesselctl/showing/JsonLine.h"
-#include "tesselctl/showing/ShownText.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -35,13 +34,10 @@ std::string changedConfiguration(const std::string& file, bool on) {
 int show(const LaunchConfiguration& launch, bool json) {
   const Tasking tasking = askTasking(launch);
   if (json) {
-    std::string line;
-    JsonObject(line)
-        .boolean("tasked", tasking.on)
-        .text("source", taskingSourceName(tasking.source))
-        .text("file", std::string_view(tasking.file))
-        .end();
-    print(line + "\n");
+    print(objectLine([&](JsonWriter& writer) {
+      writer.member("tasked", tasking.on).member("source", taskingSourceName(tasking.source));
+      writer.member("file", tasking.file);
+    }));
   } else {
     const Terminal terminal = terminalBehind(1);
     print(terminal.paint(tasking.on ? Colour::good : Colour::caution, tasking.on ? "on" : "off") +

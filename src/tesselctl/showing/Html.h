@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-#include "tesselctl/showing/ShownText.h"
+#include "platform/Text.h"
 
 namespace tessel::ctl {
 

@@ -10,6 +10,7 @@
 
 #include "tesselctl/showing/Html.h"
 #include "tesselctl/showing/ReportStyle.h"
+#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 

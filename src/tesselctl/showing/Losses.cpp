@@ -4,8 +4,8 @@
 
 #include <algorithm>
 
+#include "platform/Text.h"
 #include "tesselctl/reading/TimeArguments.h"
-#include "tesselctl/showing/ShownText.h"
 
 namespace tessel::ctl {
 

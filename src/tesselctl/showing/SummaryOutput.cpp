@@ -6,8 +6,8 @@
 #include <nlohmann/json.hpp>
 
 #include "linux/ReadingDigest.h"
+#include "platform/Text.h"
 #include "tesselctl/showing/Losses.h"
-#include "tesselctl/showing/ShownText.h"
 
 namespace tessel::ctl {
 
@@ -46,60 +46,58 @@ std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string&
   return words;
 }
 
-void writePair(std::string& out, const Tally::Pair& pair) {
-  JsonObject object(out);
-  object.text("subsystem", std::string_view(pair.subsystem))
-      .text("category", std::string_view(pair.category));
-  addVerdicts(object, pair.counts);
-  object.end();
-}
-
-void writeMiss(std::string& out, const Tally::Miss& miss) {
-  JsonObject object(out);
-  object.text("subsystem", std::string_view(miss.subsystem))
-      .text("category", std::string_view(miss.category))
-      .text("name", std::string_view(miss.name))
-      .count("slot", miss.slot)
-      .text("value", std::string_view(miss.value))
-      .count("count", miss.count)
-      .end();
-}
-
-void writeProblem(std::string& out, const FileProblem& problem) {
-  JsonObject(out)
-      .text("reason", std::string_view(problem.reason))
-      .count("count", problem.count)
-      .count("first_place", problem.firstPlace)
-      .end();
-}
-
-void writeFile(std::string& out, const FileReport& file) {
-  JsonObject object(out);
-  object.text("path", std::string_view(file.path)).count("entries_read", file.entriesRead);
-  if (file.skipped) object.text("skipped", std::string_view(*file.skipped));
-  object.array("problems", file.problems, writeProblem).end();
-}
-
-void writeKinds(std::string& out, const Tally& tally) {
-  JsonObject object(out);
-  for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
-    object.nested(Tally::kKinds[kind], [&](std::string& inner) {
-      JsonObject(inner)
-          .count("reported", tally.kinds()[kind].reported)
-          .count("unreported", tally.kinds()[kind].unreported)
-          .end();
+void writePairs(JsonWriter& json, const Tally& tally) {
+  json.array("pairs", tally.pairs(), [&](const Tally::Pair& pair) {
+    json.object([&] {
+      json.member("subsystem", pair.subsystem).member("category", pair.category);
+      addVerdicts(json, pair.counts);
     });
-  }
-  object.end();
+  });
 }
 
-void writeIntervals(std::string& out, const AssemblyCounts& counts) {
-  JsonObject(out)
-      .count("unmatched_ends", counts.unmatchedEnds)
-      .count("replaced_begins", counts.replacedBegins)
-      .count("open", counts.openIntervals)
-      .count("dropped", counts.droppedOpenIntervals)
-      .end();
+void writeMisses(JsonWriter& json, const Tally& tally) {
+  json.array("whitelist_misses", tally.misses(), [&](const Tally::Miss& miss) {
+    json.object([&] {
+      json.member("subsystem", miss.subsystem).member("category", miss.category);
+      json.member("name", miss.name).member("slot", miss.slot);
+      json.member("value", miss.value).member("count", miss.count);
+    });
+  });
+  json.member("whitelist_misses_not_listed", tally.missesNotListed());
+}
+
+void writeFiles(JsonWriter& json, const StoreReport& store) {
+  json.array("files", store.files, [&](const FileReport& file) {
+    json.object([&] {
+      json.member("path", file.path).member("entries_read", file.entriesRead);
+      json.member("skipped", file.skipped);
+      json.array("problems", file.problems, [&](const FileProblem& problem) {
+        json.object([&] {
+          json.member("reason", problem.reason).member("count", problem.count);
+          json.member("first_place", problem.firstPlace);
+        });
+      });
+    });
+  });
+}
+
+void writeKinds(JsonWriter& json, const Tally& tally) {
+  json.object("kinds", [&] {
+    for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
+      json.object(Tally::kKinds[kind], [&] {
+        json.member("reported", tally.kinds()[kind].reported);
+        json.member("unreported", tally.kinds()[kind].unreported);
+      });
+    }
+  });
+}
+
+void writeIntervals(JsonWriter& json, const AssemblyCounts& counts) {
+  json.object("intervals", [&] {
+    json.member("unmatched_ends", counts.unmatchedEnds);
+    json.member("replaced_begins", counts.replacedBegins);
+    json.member("open", counts.openIntervals).member("dropped", counts.droppedOpenIntervals);
+  });
 }
 
 std::string verdictTable(const Tally& tally, const Terminal& terminal) {
@@ -255,31 +253,26 @@ Colour verdictColour(TesselReporterClassification classification) {
   return kColours[classification];
 }
 
-void addVerdicts(JsonObject& object, const VerdictCounts& counts) {
-  for (const auto verdict : kVerdictOrder) object.count(verdictName(verdict), counts[verdict]);
+void addVerdicts(JsonWriter& json, const VerdictCounts& counts) {
+  for (const auto verdict : kVerdictOrder) json.member(verdictName(verdict), counts[verdict]);
 }
 
-std::string ruleJson(const FilterDecision& decision, const std::string& scope) {
-  std::string out;
-  JsonObject rule(out);
+void addRule(JsonWriter& json, const FilterDecision& decision, const std::string& scope) {
   if (decision.classification == TesselReporterClassificationFailedStringWhitelist) {
-    rule.count("slot", decision.stringSlot)
-        .text("label", decision.stringLabel)
-        .text("value", decision.stringValue);
-    if (decision.specialRule) rule.boolean("special", true);
+    json.object("rule", [&] {
+      json.member("slot", decision.stringSlot).member("label", decision.stringLabel);
+      json.member("value", decision.stringValue);
+      if (decision.specialRule) json.member("special", true);
+    });
   } else if (decision.classification == TesselReporterClassificationDurationThreshold) {
-    rule.number("duration", Number{decision.durationSeconds});
-  } else if (decision.downsampleEntry != nullptr) {
-    rule.text("scope", std::string_view(scope))
-        .count("cap", decision.downsampleEntry->cap())
-        .count("ratio", decision.downsampleEntry->downsampleRatio())
-        .count("seen", decision.downsampleEntry->eventsSeen())
-        .count("reported", decision.downsampleEntry->eventsReported());
-  } else {
-    return {};
+    json.object("rule", [&] { json.member("duration", decision.durationSeconds); });
+  } else if (const TRDownsampleEntry* entry = decision.downsampleEntry; entry != nullptr) {
+    json.object("rule", [&] {
+      json.member("scope", scope).member("cap", entry->cap());
+      json.member("ratio", entry->downsampleRatio()).member("seen", entry->eventsSeen());
+      json.member("reported", entry->eventsReported());
+    });
   }
-  rule.end();
-  return out;
 }
 
 std::string ruleWords(const FilterDecision& decision, const std::string& scope) {
@@ -296,32 +289,22 @@ std::string ruleWords(const FilterDecision& decision, const std::string& scope) 
 }
 
 std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
-  std::string out;
-  JsonObject object(out);
-  object.count("log_events", report.entriesRead).count("trace_objects", tally.traceObjects());
-  object.nested("verdicts", [&](std::string& inner) {
-    JsonObject verdicts(inner);
-    addVerdicts(verdicts, tally.verdicts());
-    verdicts.end();
+  return objectLine([&](JsonWriter& json) {
+    json.member("log_events", report.entriesRead).member("trace_objects", tally.traceObjects());
+    json.object("verdicts", [&] { addVerdicts(json, tally.verdicts()); });
+    writeKinds(json, tally);
+    writePairs(json, tally);
+    json.object("malformed", [&] {
+      for (const auto& [reason, count] : malformedCounts(report)) json.member(reason, count);
+    });
+    writeMisses(json, tally);
+    writeIntervals(json, report.assembly);
+    json.member("beyond_pair_limit", report.beyondPairLimit);
+    json.member("without_exe", report.assembly.withoutImagePath);
+    json.rawMember("store", jsonLine(storeJson(report.store)));
+    writeFiles(json, report.store);
+    json.member("start", tally.period().start).member("end", tally.period().end);
   });
-  object.nested("kinds", [&](std::string& inner) { writeKinds(inner, tally); });
-  object.array("pairs", tally.pairs(), writePair);
-  object.nested("malformed", [&](std::string& inner) {
-    JsonObject malformed(inner);
-    for (const auto& [reason, count] : malformedCounts(report)) malformed.count(reason, count);
-    malformed.end();
-  });
-  object.array("whitelist_misses", tally.misses(), writeMiss);
-  object.count("whitelist_misses_not_listed", tally.missesNotListed());
-  object.nested("intervals", [&](std::string& inner) { writeIntervals(inner, report.assembly); });
-  object.count("beyond_pair_limit", report.beyondPairLimit);
-  object.count("without_exe", report.assembly.withoutImagePath);
-  object.raw("store", terminalJson(jsonLine(storeJson(report.store))));
-  object.array("files", report.store.files, writeFile);
-  object.number("start", Number{int64_t{tally.period().start.time_since_epoch().count()}});
-  object.number("end", Number{int64_t{tally.period().end.time_since_epoch().count()}});
-  object.end();
-  return out;
 }
 
 std::string summaryText(const Tally& tally, const ExtractionReport& report,

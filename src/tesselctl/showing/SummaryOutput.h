@@ -8,8 +8,8 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Json.h"
 #include "tesselctl/judging/Tally.h"
-#include "tesselctl/showing/JsonLine.h"
 #include "tesselctl/showing/Terminal.h"
 #include "trace/ExtractionReport.h"
 
@@ -18,11 +18,11 @@ namespace tessel::ctl {
 Colour verdictColour(TesselReporterClassification classification);
 
 // A count under the name of each verdict.
-void addVerdicts(JsonObject& object, const VerdictCounts& counts);
+void addVerdicts(JsonWriter& json, const VerdictCounts& counts);
 
-// The reason of a verdict as a JSON object; empty where the verdict says it all.
-std::string ruleJson(const FilterDecision& decision, const std::string& scope);
-// The same as a sentence, fit for a terminal.
+// The reason of a verdict as the member "rule"; none if the verdict says it all.
+void addRule(JsonWriter& json, const FilterDecision& decision, const std::string& scope);
+// The same as a sentence, fit for a terminal; empty if the verdict says it all.
 std::string ruleWords(const FilterDecision& decision, const std::string& scope);
 
 // The figures as one JSON object on one line.

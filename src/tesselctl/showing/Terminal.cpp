@@ -1,24 +1,75 @@
-// Widths, colours, tables.
+// Measuring, colouring and laying out.
 
 #include "tesselctl/showing/Terminal.h"
 
 #include <sys/ioctl.h>
+#include <unicode/uchar.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <numeric>
 
-#include "tesselctl/showing/ShownText.h"
+#include "platform/Text.h"
 
 namespace tessel::ctl {
 
 namespace {
 
+// A narrower terminal counts as one of 40 columns: on less, tables would be all ellipses.
 constexpr size_t kNarrowest = 40;
 constexpr size_t kGap = 2;            // between columns
-constexpr size_t kLeastShrunken = 8;  // columns that a shrinking text keeps
+constexpr size_t kLeastShrunken = 8;  // columns of a text of which both ends still say something
+constexpr size_t kBarWidth = 30;
+constexpr std::chrono::seconds kPatience{1};               // before a bar is drawn
+constexpr std::chrono::milliseconds kRedrawInterval{100};  // as often as eyes follow
+constexpr std::string_view kEllipsis = "\u2026";
+
+// A terminal gives a mark no column of its own and an East Asian character two. Which is which
+// changes with each version of Unicode, so the tables are those of the Unicode library. Characters
+// of "ambiguous" width count as one: only East Asian terminals give them two.
+size_t widthOf(char32_t point) {
+  switch (u_charType(static_cast<UChar32>(point))) {
+    case U_NON_SPACING_MARK:
+    case U_ENCLOSING_MARK:
+    case U_FORMAT_CHAR:
+      return 0;
+    default:
+      break;
+  }
+  const int width = u_getIntPropertyValue(static_cast<UChar32>(point), UCHAR_EAST_ASIAN_WIDTH);
+  return width == U_EA_WIDE || width == U_EA_FULLWIDTH ? 2 : 1;
+}
+
+// How many of `widths`, from the first on, fit `width` columns.
+size_t fitting(const std::vector<size_t>& widths, size_t width) {
+  size_t count = 0;
+  for (size_t used = 0; count < widths.size() && used + widths[count] <= width; ++count)
+    used += widths[count];
+  return count;
+}
+
+// `text` in at most `width` columns: its beginning, an ellipsis, `tailWidth` columns of its end.
+std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
+  if (displayWidth(text) <= width) return std::string(text);
+  if (width == 0) return {};
+  std::vector<std::string_view> characters;
+  std::vector<size_t> widths;
+  forEachCharacter(text, [&](const Character& character) {
+    characters.push_back(character.bytes);
+    widths.push_back(widthOf(character.point));
+  });
+  const size_t head = fitting(widths, width - 1 - tailWidth);
+  std::reverse(widths.begin(), widths.end());
+  const size_t tail = fitting(widths, tailWidth);
+  std::string out;
+  for (size_t at = 0; at < head; ++at) out += characters[at];
+  out += kEllipsis;
+  for (size_t at = characters.size() - tail; at < characters.size(); ++at) out += characters[at];
+  return out;
+}
 
 bool coloursWanted() {
   const char* refused = std::getenv("NO_COLOR");
@@ -72,6 +123,21 @@ Terminal terminalBehind(int fd) {
   return terminal;
 }
 
+// Most texts are ASCII and need no tables; a table measures each of its cells.
+size_t displayWidth(std::string_view text) {
+  const auto isPlain = [](char byte) { return byte >= 0x20 && byte < 0x7f; };
+  if (std::all_of(text.begin(), text.end(), isPlain)) return text.size();
+  size_t width = 0;
+  forEachCharacter(text, [&](const Character& character) { width += widthOf(character.point); });
+  return width;
+}
+
+std::string shortened(std::string_view text, size_t width) {
+  return abridged(text, width, width == 0 ? 0 : (width - 1) / 2);
+}
+
+std::string cutOff(std::string_view text, size_t width) { return abridged(text, width, 0); }
+
 std::vector<size_t> Table::widths(size_t available) const {
   std::vector<size_t> widths;
   for (size_t column = 0; column < columns_.size(); ++column) {
@@ -79,6 +145,8 @@ std::vector<size_t> Table::widths(size_t available) const {
     for (const auto& row : rows_) widest = std::max(widest, displayWidth(row[column].text));
     widths.push_back(widest);
   }
+  // Always the widest column gives way, one column of the terminal at a time: so the wide ones end
+  // up equal and narrow ones are left alone. The row stays too wide if none can give more.
   const size_t gaps = kGap * (columns_.size() - 1);
   size_t total = std::accumulate(widths.begin(), widths.end(), gaps);
   while (total > available) {
@@ -134,13 +202,39 @@ std::string wrapped(std::string_view text, size_t width, size_t indent) {
   return out;
 }
 
+// Whoever reads a pipe may leave early, as `head` does. There is nobody left to complain to, so the
+// process ends at once and without flushing what nobody takes.
 void print(std::string_view text) {
   if (std::fwrite(text.data(), 1, text.size(), stdout) != text.size()) std::_Exit(1);
 }
 
+// Standard output is flushed first: both may be the same terminal, where order matters.
 void printError(std::string_view text) {
   std::fflush(stdout);
   std::fwrite(text.data(), 1, text.size(), stderr);
+}
+
+ProgressBar::ProgressBar(bool wanted)
+    : wanted_(wanted),
+      terminal_(terminalBehind(STDERR_FILENO)),
+      nextLook_(std::chrono::steady_clock::now() + kPatience) {}
+
+void ProgressBar::update(double part, uint64_t entries) {
+  if (!wanted_ || !terminal_.interactive) return;
+  const auto now = std::chrono::steady_clock::now();
+  if (now < nextLook_) return;
+  nextLook_ = now + kRedrawInterval;
+  const double done = std::clamp(part, 0.0, 1.0);
+  const auto filled = static_cast<size_t>(std::lround(done * static_cast<double>(kBarWidth)));
+  std::string line = "\r[" + std::string(filled, '#') + std::string(kBarWidth - filled, '-') + "] ";
+  line += std::to_string(std::lround(done * 100)) + " %  " + counted(entries, "entry", "entries");
+  printError(cutOff(line, terminal_.width) + "\x1b[K");
+  visible_ = true;
+}
+
+void ProgressBar::clear() {
+  if (visible_) printError("\r\x1b[K");
+  visible_ = false;
 }
 
 }  // namespace tessel::ctl

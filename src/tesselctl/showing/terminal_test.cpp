@@ -1,10 +1,8 @@
 // Columns of text, tables and lines on a terminal.
 
-#include "tesselctl/showing/ShownText.h"
+#include "tesselctl/showing/Terminal.h"
 
 #include <gtest/gtest.h>
-
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 namespace {
