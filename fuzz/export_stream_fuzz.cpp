@@ -18,12 +18,13 @@ void append(int file, const void* data, size_t size) {
     std::abort();
 }
 
-void readAll(tessel::ExportEntryStream& stream, const tessel::TracePointTable& table) {
+void readAll(tessel::ExportEntryStream& stream, tessel::TracePointTable& table) {
   while (stream.next()) {
     for (const tessel::FieldToken token : stream.entry().tokens) {
       if (table.kind(token) == tessel::FieldKind::name && table.text(token).text().size() > 4096)
         std::abort();
     }
+    if (table.full()) table.startGeneration();
   }
 }
 

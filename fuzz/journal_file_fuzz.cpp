@@ -45,7 +45,7 @@ bool makeFile(int file, std::span<const uint8_t> input) {
   return true;
 }
 
-void readAll(JournalEntryStream& stream, const TracePointTable& table, size_t most) {
+void readAll(JournalEntryStream& stream, TracePointTable& table, size_t most) {
   size_t entries = 0;
   while (stream.next()) {
     if (++entries > most) std::abort();
@@ -53,6 +53,7 @@ void readAll(JournalEntryStream& stream, const TracePointTable& table, size_t mo
       if (table.kind(token) == FieldKind::name && table.text(token).text().size() > 4096)
         std::abort();
     }
+    if (table.full()) table.startGeneration();
   }
 }
 

@@ -58,7 +58,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   while (!rest.empty()) {
     header.monotonic += static_cast<uint8_t>(rest.front());
     header.bootId[0] = rest.front() & 1;
-    table.beginEntry();
     std::vector<FieldToken> tokens;
     for (std::string_view line = takeLine(rest); !line.empty(); line = takeLine(rest)) {
       const std::string_view name = line.substr(0, line.find('='));
@@ -71,6 +70,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     assembler.consume({header, tokens});
   }
   const AssemblyCounts counts = assembler.counts();
+  const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
+                          counts.openIntervals;
+  const uint64_t ends = counts.pairedEnds + counts.unmatchedEnds;
+  if (counts.tracePoints != counts.events + begins + ends) std::abort();
   if (counts.openIntervals > 8) std::abort();
   return 0;
 }

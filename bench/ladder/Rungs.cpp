@@ -27,7 +27,6 @@ class Glance final : public FieldTokenizer {
     return wants(name) ? 1 : kNoToken;
   }
   uint32_t generation() const override { return 0; }
-  void beginEntry() override {}
 };
 
 [[noreturn]] void fail(const std::string& why) {

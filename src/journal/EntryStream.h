@@ -65,13 +65,11 @@ class FieldTokenizer {
   // length in bytes, as far as known: where `value` is only the beginning, it may be any number
   // greater than value.size(). The same text may be shown more than once.
   virtual FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) = 0;
-  // Changes when all tokens handed out so far become void (the tokenizer was emptied to stay within
-  // its memory); a reader then drops what it remembers and asks again. Changes only inside
-  // beginEntry().
+  // Changes when all tokens handed out so far become void, because the tokenizer was emptied to
+  // stay within its memory. A reader compares it before it collects the tokens of an entry, and
+  // where it changed drops all tokens that it remembers. It changes only between two entries: from
+  // the call of EntryStream::entry() until its user is done with the tokens, every token is good.
   virtual uint32_t generation() const = 0;
-  // Called by the innermost reader before it collects the tokens of an entry: from here until the
-  // entry was consumed no token becomes void.
-  virtual void beginEntry() = 0;
 };
 
 // Where an entry stands in time and in the journal's own order.

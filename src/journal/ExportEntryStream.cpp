@@ -253,7 +253,6 @@ void ExportEntryStream::waitAtEntry() {
 }
 
 Entry ExportEntryStream::entry() {
-  tokenizer_.beginEntry();
   resources_.tokens.clear();
   for (const KeptField& field : keptFields_) {
     const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);

@@ -120,7 +120,6 @@ void JournalEntryStream::finish() {
 
 Entry JournalEntryStream::entry() {
   if (!entryMarked_) return {entry_, {}};
-  context_.tokenizer.beginEntry();
   const size_t count = collectTokens();
   return {entry_, std::span(context_.resources.tokens).first(count)};
 }

@@ -28,7 +28,6 @@ class LossTokenizer final : public FieldTokenizer {
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return user_.generation(); }
-  void beginEntry() override { user_.beginEntry(); }
 
   // The user's tokens among those of an entry; valid until the next call. Where the entry tells of
   // a loss, that is counted.

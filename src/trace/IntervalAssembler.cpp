@@ -23,11 +23,7 @@ static_assert(inSlot(FieldKind::string1Name, kLabelledStrings) == FieldKind::num
 
 IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
                                      OpenIntervalLimits limits)
-    : table_(table), sink_(sink), open_(limits) {
-  table_.setHolder(this);
-}
-
-IntervalAssembler::~IntervalAssembler() { table_.setHolder(nullptr); }
+    : table_(table), sink_(sink), open_(limits) {}
 
 AssemblyCounts IntervalAssembler::counts() const {
   AssemblyCounts counts = counts_;
@@ -36,7 +32,15 @@ AssemblyCounts IntervalAssembler::counts() const {
   return counts;
 }
 
+// The reader collects the tokens of an entry just before this call and those of the next one after
+// it. So at its end nobody holds a token but the open intervals, and the table may be emptied.
 void IntervalAssembler::consume(const Entry& entry) {
+  take(entry);
+  if (table_.full()) [[unlikely]]
+    startGeneration();
+}
+
+void IntervalAssembler::take(const Entry& entry) {
   if (!meansToBeATracePoint(entry.tokens)) return;
   read(entry.tokens);
   if (const auto reason = fault()) {
@@ -89,6 +93,7 @@ std::optional<MalformedReason> IntervalAssembler::fault() const {
 }
 
 void IntervalAssembler::emitEvent() {
+  ++counts_.events;
   if (!sink_.admits(table_.text(point_[FieldKind::subsystem]),
                     table_.text(point_[FieldKind::category]))) {
     return;
@@ -109,6 +114,7 @@ void IntervalAssembler::end(const EntryHeader& header) {
     ++counts_.unmatchedEnds;
     return;
   }
+  ++counts_.pairedEnds;
   const auto microseconds = static_cast<int64_t>(header.monotonic - begin->monotonic);
   const auto seconds = static_cast<float>(static_cast<double>(microseconds) / 1e6);
   if (sink_.admits(table_.text(begin->key.subsystem), table_.text(begin->key.category))) {
@@ -190,18 +196,19 @@ void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
   }
 }
 
-void IntervalAssembler::renewTokens(TracePointTable& table) {
+void IntervalAssembler::startGeneration() {
+  TracePointTable::Renewal renewal = table_.startGeneration();
   open_.renewAll([&](OpenInterval& interval) {
-    if (!table.hasRoomForRenewal()) return false;
-    for (FieldToken& token : interval.tokens) token = table.renewed(token);
-    for (FieldToken& token : interval.attributes) token = table.renewed(token);
+    if (!renewal.hasRoom()) return false;
+    for (FieldToken& token : interval.tokens) token = renewal.renewed(token);
+    for (FieldToken& token : interval.attributes) token = renewal.renewed(token);
     const auto token = [&](FieldKind kind) { return tokenOf(interval.tokens, kind); };
     IntervalKey& key = interval.key;
-    key.boot = table.renewed(key.boot);
+    key.boot = renewal.renewed(key.boot);
     key.subsystem = token(FieldKind::subsystem);
     key.category = token(FieldKind::category);
     key.name = token(FieldKind::name);
-    key.id = table.identity(token(FieldKind::intervalId));
+    key.id = table_.identity(token(FieldKind::intervalId));
     if (key.process != IntervalKey::kSystemScope) key.process = token(FieldKind::process);
     return true;
   });

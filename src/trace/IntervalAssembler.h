@@ -38,6 +38,8 @@ class TraceObjectSink {
 
 struct AssemblyCounts {
   uint64_t tracePoints = 0;  // well-formed entries: events, begins, ends
+  uint64_t events = 0;
+  uint64_t pairedEnds = 0;  // ends that met their begin
   std::array<uint64_t, kMalformedReasons> malformed{};
   uint64_t withoutImagePath = 0;      // trace points without _EXE
   uint64_t unmatchedEnds = 0;         // ends whose begin was not read
@@ -46,14 +48,15 @@ struct AssemblyCounts {
   uint64_t openIntervals = 0;         // begins that still wait for their end
 };
 
-class IntervalAssembler final : private TokenHolder {
+class IntervalAssembler {
  public:
-  // REQUIRES: table and sink outlive the assembler. It is the table's token holder.
+  // REQUIRES: table and sink outlive the assembler, and nobody else keeps tokens of the table.
   IntervalAssembler(TracePointTable& table, TraceObjectSink& sink, OpenIntervalLimits limits = {});
-  ~IntervalAssembler() override;
   IntervalAssembler(const IntervalAssembler&) = delete;
   IntervalAssembler& operator=(const IntervalAssembler&) = delete;
 
+  // Takes in one entry. Afterwards its tokens are no longer good: where the table is full, it
+  // starts a new generation.
   void consume(const Entry& entry);
   AssemblyCounts counts() const;
 
@@ -66,7 +69,8 @@ class IntervalAssembler final : private TokenHolder {
     FieldToken operator[](FieldKind kind) const { return tokens[static_cast<size_t>(kind)]; }
   };
 
-  void renewTokens(TracePointTable& table) override;
+  void take(const Entry& entry);
+  void startGeneration();
   bool meansToBeATracePoint(std::span<const FieldToken> tokens) const;
   void read(std::span<const FieldToken> tokens);
   std::optional<MalformedReason> fault() const;

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "journal/JournalStore.h"
+#include "platform/Invariant.h"
 
 namespace tessel {
 
@@ -14,6 +15,17 @@ constexpr uint64_t kEntriesPerStep = 4096;
 // Dates before 1970 are before every entry.
 uint64_t microsecondsSince1970(Date date) {
   return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
+}
+
+// The books of the run. Every trace point is an event, a begin or an end, and each of these came to
+// exactly one of its fates; every event and every pair was delivered or refused.
+void checkBooks(const ExtractionReport& report) {
+  const AssemblyCounts& counts = report.assembly;
+  const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
+                          counts.openIntervals;
+  const uint64_t ends = counts.pairedEnds + counts.unmatchedEnds;
+  TESSEL_INVARIANT(counts.tracePoints == counts.events + begins + ends);
+  TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + report.beyondPairLimit);
 }
 
 }  // namespace
@@ -71,6 +83,7 @@ void JournalExtractor::processEntries(EntryStream& entries) {
     current_ = &entry.header;
     assembler_.consume(entry);
   }
+  checkBooks(report());
   report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);
 }
 

@@ -4,6 +4,7 @@
 
 #include <charconv>
 
+#include "platform/Invariant.h"
 #include "trace/DecimalNumber.h"
 
 namespace tessel {
@@ -159,7 +160,6 @@ FieldToken TracePointTable::textToken(FieldKind kind, std::string_view value) {
 
 FieldToken TracePointTable::add(const Field& field) {
   contents_.fields.push_back(field);
-  grown_ = true;
   const size_t index = contents_.fields.size() - 1;
   return static_cast<FieldToken>(field.kind) << kIndexBits | static_cast<FieldToken>(index);
 }
@@ -201,29 +201,19 @@ MalformedReason TracePointTable::malformedReason(FieldToken token) const {
   return static_cast<MalformedReason>(at(token).whole & ~kMalformedRequired);
 }
 
-// Whether the table holds more than its limits divided by `share`.
-bool TracePointTable::holds(size_t share) const {
-  return contents_.fields.size() + contents_.attributes.size() > limits_.fields / share ||
-         contents_.strings->memoryUsed() > limits_.textBytes / share;
-}
-
-bool TracePointTable::hasRoomForRenewal() const { return !holds(2); }
-
-void TracePointTable::beginEntry() {
-  if (!std::exchange(grown_, false) || !holds(1)) return;
+TracePointTable::Renewal TracePointTable::startGeneration() {
   ++generation_;
   lastBootToken_ = kNoToken;
-  Contents old = std::exchange(contents_, emptyContents(limits_));
-  if (holder_ == nullptr) return;
-  old_ = &old;
-  holder_->renewTokens(*this);
-  old_ = nullptr;
+  return {*this, std::exchange(contents_, emptyContents(limits_))};
 }
 
-// Leaves a forwarding note in the old table, so that what many hold is renewed once.
-FieldToken TracePointTable::renewed(FieldToken old) {
+// Many intervals hold the same token. The first exchange leaves the new token in the old table, so
+// that a value is interned again only once.
+FieldToken TracePointTable::Renewal::renewed(FieldToken old) {
   if (old == kNoToken) return kNoToken;
-  Field& field = old_->fields[indexOf(old)];
+  Field& field = old_.fields[indexOf(old)];
+  // A token of an earlier generation would stand for another value here.
+  TESSEL_INVARIANT(field.kind == kind(old));
   if (field.form != Form::forwarded) {
     field.whole = addAgain(field);
     field.form = Form::forwarded;
@@ -231,14 +221,14 @@ FieldToken TracePointTable::renewed(FieldToken old) {
   return static_cast<FieldToken>(field.whole);
 }
 
-FieldToken TracePointTable::addAgain(const Field& old) {
-  if (old.form == Form::text) return textToken(old.kind, StringRef(old.record).text());
+FieldToken TracePointTable::Renewal::addAgain(const Field& old) {
+  if (old.form == Form::text) return table_.textToken(old.kind, StringRef(old.record).text());
   if (old.kind == FieldKind::attribute) {
-    const auto& [key, value] = old_->attributes[old.whole];
-    return addAttribute(key.text(), value.text());
+    const auto& [key, value] = old_.attributes[old.whole];
+    return table_.addAttribute(key.text(), value.text());
   }
   const bool once = old.kind == FieldKind::process || old.kind <= FieldKind::telemetry;
-  return once ? addOnce(old) : add(old);
+  return once ? table_.addOnce(old) : table_.add(old);
 }
 
 }  // namespace tessel

@@ -1,11 +1,15 @@
-// TracePointTable: each distinct FIELD=value of the store, parsed and interned once.
+// TracePointTable: parses and interns each distinct FIELD=value of the store once.
 //
-// A token is a kind of field and an index into the table. Equal values of a string, a process or a
-// boot have equal tokens, equal ids of intervals equal identities, so whoever pairs or counts
-// compares integers. The table is bounded:
-// over its limits it is emptied between two entries and starts a new generation, with a new string
-// pool; delivered objects keep the old pool alive as long as they need it, and a TokenHolder takes
-// along what it holds.
+// Its answer is a token: token = kind << 24 | index into the table. Equal values of a string, a
+// process or a boot have equal tokens, and equal ids of intervals have equal identities, so whoever
+// pairs or counts compares integers.
+//
+// A day may hold more distinct values than fit into memory. A table that is full() is therefore
+// emptied, which starts a new generation of tokens and a new pool of strings. Its one user does
+// that between two entries, when nobody but itself holds a token, and exchanges the tokens that it
+// holds. Objects that were delivered hold no tokens; they keep the old pool of strings alive. The
+// alternative, to throw out single values that were not used for long, was discarded: it would
+// need a count of users for every value, and a reader would have to ask about every token.
 //
 // Threads: one at a time. The strings may be read from any thread by whoever keeps the pool.
 
@@ -23,17 +27,9 @@
 
 namespace tessel {
 
-class TracePointTable;
-
-// Keeps tokens from one entry to the next.
-class TokenHolder {
- public:
-  virtual ~TokenHolder() = default;
-  // The table starts a new generation: every token that is kept must be exchanged, through
-  // table.renewed(), while table.hasRoomForRenewal().
-  virtual void renewTokens(TracePointTable& table) = 0;
-};
-
+// 512 Ki values of 16 bytes are 8 MiB, and 6 MiB hold the texts of about as many: the strings of an
+// ordinary day fit several times over. While a generation is replaced, the old one and at most half
+// of a new one are in memory together, so the whole stays near 20 MiB.
 struct TracePointTableLimits {
   size_t fields = size_t{512} * 1024;          // distinct values; at most 16 million
   size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
@@ -43,14 +39,10 @@ class TracePointTable final : public FieldTokenizer {
  public:
   explicit TracePointTable(TracePointTableLimits limits = {});
 
-  // REQUIRES: `holder`, where not null, outlives the last call of beginEntry().
-  void setHolder(TokenHolder* holder) { holder_ = holder; }
-
   std::vector<EntryMark> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return generation_; }
-  void beginEntry() override;
 
   FieldToken bootToken(const Id128& boot);
 
@@ -78,9 +70,12 @@ class TracePointTable final : public FieldTokenizer {
   // Keeps every string of this generation alive.
   std::shared_ptr<const StringPool> strings() const { return contents_.strings; }
 
-  // Within TokenHolder::renewTokens(): the token of the new generation for one of the old.
-  FieldToken renewed(FieldToken old);
-  bool hasRoomForRenewal() const;
+  // Whether the table is over its limits, and a new generation is due before the next entry.
+  bool full() const { return holds(1); }
+  class Renewal;
+  // Empties the table. REQUIRES: no token of an entry is in use. Every token is void after the
+  // call; one that is to be kept is exchanged through the answer.
+  Renewal startGeneration();
 
  private:
   enum class Form : uint8_t { none, text, whole, unsignedWhole, fraction, real, forwarded };
@@ -125,17 +120,36 @@ class TracePointTable final : public FieldTokenizer {
   FieldToken textToken(FieldKind kind, std::string_view value);
   FieldToken add(const Field& field);
   FieldToken addOnce(const Field& field);
-  bool holds(size_t share) const;
-  FieldToken addAgain(const Field& old);
+  // Whether the table holds more than its limits divided by `share`.
+  bool holds(size_t share) const {
+    return contents_.fields.size() + contents_.attributes.size() > limits_.fields / share ||
+           contents_.strings->memoryUsed() > limits_.textBytes / share;
+  }
 
   const TracePointTableLimits limits_;
-  TokenHolder* holder_ = nullptr;
   uint32_t generation_ = 0;
-  bool grown_ = false;  // since the limits were looked at
   Contents contents_;
-  Contents* old_ = nullptr;  // while tokens are renewed
   Id128 lastBoot_{};
   FieldToken lastBootToken_ = kNoToken;
+};
+
+// A generation that was just started, together with the values of the one before. REQUIRES: the
+// table outlives it, and no entry is read while it lives.
+class TracePointTable::Renewal {
+ public:
+  // The token of the new generation for one of the old.
+  FieldToken renewed(FieldToken old);
+  // Whether more may be kept. What is kept fills at most half of the table, or the next generation
+  // would be due at once.
+  bool hasRoom() const { return !table_.holds(2); }
+
+ private:
+  friend class TracePointTable;
+  Renewal(TracePointTable& table, Contents old) : table_(table), old_(std::move(old)) {}
+  FieldToken addAgain(const Field& old);
+
+  TracePointTable& table_;
+  Contents old_;
 };
 
 }  // namespace tessel

@@ -291,6 +291,10 @@ TEST_F(IntervalAssemblerTest, attributesOfOpenIntervalsAreBounded) {
        "begin|INTERVAL_ID=2|ATTRIBUTE=a=1|ATTRIBUTE=b=2"});
   EXPECT_EQ(assembler().counts().droppedOpenIntervals, 1u);
   EXPECT_EQ(run({"end|INTERVAL_ID=1", "end|INTERVAL_ID=2"}).size(), 1u);
+  run({"begin|INTERVAL_ID=1", "begin|INTERVAL_ID=2|ATTRIBUTE=a=1",
+       "begin|INTERVAL_ID=1|ATTRIBUTE=a=1|ATTRIBUTE=b=2|ATTRIBUTE=c=3"});
+  EXPECT_EQ(assembler().counts().replacedBegins, 1u);
+  EXPECT_EQ(assembler().counts().droppedOpenIntervals, 2u);
 }
 
 TEST_F(IntervalAssemblerTest, openIntervalsOutliveTheTablesGeneration) {

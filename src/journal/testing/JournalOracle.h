@@ -30,7 +30,6 @@ class RecordingTokenizer final : public FieldTokenizer {
   bool wants(std::string_view) const override { return true; }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return 0; }
-  void beginEntry() override {}
 
   const std::string& text(FieldToken token) const { return texts_.at(token - 1); }
   // How often a text was shown.
