@@ -1,4 +1,4 @@
-"""A machine on which things go wrong, by a preloaded library or from outside, and what must hold then."""
+"""A machine on which a preloaded library (fault_shim.c) injects faults, and the checks that follow one."""
 import contextlib
 import json
 import os
@@ -6,6 +6,7 @@ import shutil
 import sqlite3
 import sys
 import threading
+import time
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
 
@@ -13,7 +14,7 @@ from harness import BIN, Machine  # noqa: E402
 
 SHIM = os.path.join(BIN, "fault_shim.so")
 BAILED = "Bailing due to cookie file"
-# Each step of a run by a line that the log has for it, and whether the run marker is there then.
+# The steps of a run: a line that the step logs, and whether the run marker exists at that moment.
 STEPS = [("Checking in", False), ("Reporting based on being tasked-on", False), ("Created cookie file", True),
          ("Filesystem for", True), ("Boot disk type", True), ("mach time units per quantum", True),
          ("Sleeping for", True), ("Total tessel object count", True), ("(Count reported to Statora)", True),
@@ -22,7 +23,7 @@ STEPS = [("Checking in", False), ("Reporting based on being tasked-on", False), 
 
 
 def stable(rows):
-    """Rows without what differs from run to run."""
+    """The rows without the duration, which differs from run to run."""
     return [(name, [pair for pair in payload if pair[0] != "ProcessingDurationInSeconds"]) for name, payload in rows]
 
 
@@ -31,16 +32,23 @@ def is_subsequence(part, whole):
     return all(row in rest for row in part)
 
 
+class NeverInjected(AssertionError):
+    """The program ended before its fault could strike, so the test has shown nothing."""
+
+
 class FaultMachine(Machine):
     def __init__(self, points):
         super().__init__()
         self.task()
         self.durable = os.path.join(self.root, "durable")
+        self.struck = os.path.join(self.root, "struck")
         self.expected = self.rows_of_a_good_run(points)
 
     def rows_of_a_good_run(self, points):
         self.write_export(points)
+        began = time.monotonic()
         result = self.run()
+        self.duration = time.monotonic() - began
         assert result.status == 0, result.errors
         rows = stable(self.rows())
         self.forget_state()
@@ -51,19 +59,34 @@ class FaultMachine(Machine):
             shutil.rmtree(folder, ignore_errors=True)
             os.mkdir(folder)
 
-    def faults(self, **faults):
+    @staticmethod
+    def faults(**faults):
         """The environment that makes the faults; keywords are the library's variables without FAULT_."""
         options = "verify_asan_link_order=0:handle_segv=1"
         return {"LD_PRELOAD": SHIM, "ASAN_OPTIONS": options,
                 **{"FAULT_" + key: str(value) for key, value in faults.items()}}
 
-    def run_faulty(self, **faults):
-        return self.run(**self.faults(**faults))
+    def start_faulty(self, environment=None, **faults):
+        """Starts the service with faults; result() then insists that one of them struck."""
+        with contextlib.suppress(FileNotFoundError):
+            os.unlink(self.struck)
+        process = self.start(**self.faults(STRUCK=self.struck, **faults), **(environment or {}))
+        process.tessel_faulty = True
+        return process
+
+    def run_faulty(self, environment=None, **faults):
+        return self.result(self.start_faulty(environment, **faults))
+
+    def result(self, process, timeout=120):
+        result = super().result(process, timeout)
+        if getattr(process, "tessel_faulty", False) and not os.path.exists(self.struck):
+            raise NeverInjected("the fault was never injected")
+        return result
 
     def count_calls(self, **faults):
-        """How many calls a good run makes that the faults would be about."""
+        """How many calls of a good run the faults could strike."""
         count = os.path.join(self.root, "count")
-        self.run_faulty(COUNT=count, **faults)
+        self.run(**self.faults(COUNT=count, **faults))
         self.forget_state()
         with open(count, encoding="ascii") as file:
             return int(file.read())
@@ -87,14 +110,14 @@ class FaultMachine(Machine):
             return [row[0] for row in database.execute("SELECT id FROM events ORDER BY id")]
 
     def stored(self):
-        """The rows, after a look at the database's health."""
+        """The rows of a spool that passes the database's integrity check and has no gap."""
         ids = self.ids()
         rows = stable(self.rows())
         assert ids == list(range(1, len(ids) + 1)), "a row is missing in the middle"
         return rows
 
     def use_what_a_power_cut_leaves(self):
-        """Puts in place of the spool what had been flushed of it when the process was killed."""
+        """Replaces the spool by its files as they were last flushed before the kill."""
         for suffix in ("", "-wal", "-shm"):
             with contextlib.suppress(FileNotFoundError):
                 os.unlink(os.path.join(self.state, "statora.db" + suffix))
@@ -104,7 +127,7 @@ class FaultMachine(Machine):
 
 
 class Watcher(threading.Thread):
-    """Follows how many rows another client of the spool has seen committed."""
+    """Another client of the spool: counts the rows that it has seen committed."""
 
     def __init__(self, machine):
         super().__init__()

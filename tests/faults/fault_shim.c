@@ -1,21 +1,20 @@
-// A library to preload into the service: makes a chosen system call fail, kills the process at a
-// chosen call or log line, steps the clock, and keeps what a power cut would leave.
+// A library to preload into the service. It makes a chosen system call fail, kills the process at a
+// chosen call or log line, shifts the clock, and keeps the files that a power cut would leave.
 //
-//   FAULT_PATH     text in the path of the files that faults are about
-//   FAULT_AT       number of the first call about such a file that the fault strikes; 1 is the first
-//   FAULT_TIMES    how many calls it strikes from there on; default all
-//   FAULT_ERRNO    what they fail with; 0 kills the process instead of letting the call happen
-//   FAULT_SYNC     1: only flushes count as calls
-//   FAULT_COUNT    file that the number of calls is written to, call by call
-//   FAULT_LINE     text of a log line on standard error, right after which the process is killed
-//   FAULT_DURABLE  directory that a file is copied to whenever it has been flushed
-//   FAULT_CLOCK    file with seconds by which the wall clock is wrong; may appear at any time
-//   FAULT_HURRY    1: a wait of less than two seconds for which nothing comes is over after a
-//                  millisecond; what it should have taken has passed by the wall clock and by the
-//                  clock since boot, and by the steady clock of the thread that waited
-//
-// Calls are counted that change a file: open for creating, write, truncate, flush, map, rename,
-// remove.
+//   FAULT_PATH     the faults strike files whose path contains this text
+//   FAULT_CALL     only this call counts, for example "flock"; by default every call that changes a
+//                  file: open for creating, write, truncate, flush, map, rename, remove
+//   FAULT_AT       number of the first call that fails; 1 is the first on such a file
+//   FAULT_TIMES    how many calls in a row fail; by default all that follow
+//   FAULT_ERRNO    the error of a call that fails; 0 kills the process before the call
+//   FAULT_COUNT    file that receives the number of calls so far
+//   FAULT_LINE     kills the process after it wrote this text to standard error
+//   FAULT_DURABLE  directory that receives a copy of each file whenever the file is flushed
+//   FAULT_CLOCK    file with the seconds by which the wall clock is wrong; it may appear at any time
+//   FAULT_HURRY    1: a wait of less than two seconds ends after a millisecond. The wall clock, the
+//                  clock since boot and the steady clock of that thread jump over the rest
+//   FAULT_STRUCK   file that is made when the first fault strikes, so that a test can tell a
+//                  service that withstood its fault from one that never met it
 
 #define _GNU_SOURCE
 #include <dlfcn.h>
@@ -28,6 +27,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/file.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -43,12 +43,21 @@ static long number(const char* variable, long otherwise) {
   return text != NULL ? atol(text) : otherwise;
 }
 
-// By system call, so that no wrapper of a sanitizer or of this file is in the way.
+// A direct system call: the functions of this file and of a sanitizer would count it as a call of
+// the service.
 static long rawOpen(const char* path, int flags, int mode) {
   return syscall(SYS_openat, AT_FDCWD, path, flags, mode);
 }
 
+static void noteStrike(void) {
+  static atomic_flag noted = ATOMIC_FLAG_INIT;
+  const char* path = getenv("FAULT_STRUCK");
+  if (path == NULL || atomic_flag_test_and_set(&noted)) return;
+  syscall(SYS_close, (int)rawOpen(path, O_WRONLY | O_CREAT, 0600));
+}
+
 static void die(void) {
+  noteStrike();
   syscall(SYS_kill, getpid(), SIGKILL);
 }
 
@@ -62,11 +71,16 @@ static void writeCount(long count) {
   syscall(SYS_close, file);
 }
 
-// Whether the call is to fail; errno is set then.
-static int struck(const char* path, int isFlush) {
+// A lock changes no file, so it counts only where FAULT_CALL names it.
+static int counts(const char* name) {
+  const char* wanted = getenv("FAULT_CALL");
+  return strcmp(name, wanted != NULL ? wanted : "flock") == 0 ? wanted != NULL : wanted == NULL;
+}
+
+// Whether the call must fail; then errno is set.
+static int struck(const char* name, const char* path) {
   const char* wanted = getenv("FAULT_PATH");
-  if (wanted == NULL || path == NULL || strstr(path, wanted) == NULL) return 0;
-  if (number("FAULT_SYNC", 0) != 0 && !isFlush) return 0;
+  if (wanted == NULL || path == NULL || strstr(path, wanted) == NULL || !counts(name)) return 0;
   const long call = atomic_fetch_add(&calls, 1) + 1;
   writeCount(call);
   const long first = number("FAULT_AT", 0);
@@ -74,6 +88,7 @@ static int struck(const char* path, int isFlush) {
   if (first == 0 || call < first || (times != 0 && call >= first + times)) return 0;
   const int error = (int)number("FAULT_ERRNO", EIO);
   if (error == 0) die();
+  noteStrike();
   errno = error;
   return 1;
 }
@@ -87,13 +102,13 @@ static const char* pathOf(int fd, char* buffer, size_t size) {
   return buffer;
 }
 
-static int struckFd(int fd, int isFlush) {
+static int struckFd(const char* name, int fd) {
   char buffer[4096];
   if (getenv("FAULT_PATH") == NULL) return 0;
-  return struck(pathOf(fd, buffer, sizeof buffer), isFlush);
+  return struck(name, pathOf(fd, buffer, sizeof buffer));
 }
 
-// A copy under another name, renamed when complete: a kill in the middle leaves the one before.
+// Copies to another name and renames: a kill in the middle then leaves the previous copy whole.
 static void keepDurable(int fd) {
   const char* directory = getenv("FAULT_DURABLE");
   char path[4096], fresh[5000], kept[5000], block[65536];
@@ -114,7 +129,7 @@ static void keepDurable(int fd) {
 }
 
 static int opened(const char* path, int flags) {
-  return (flags & O_CREAT) != 0 && struck(path, 0) ? -1 : 0;
+  return (flags & O_CREAT) != 0 && struck("open", path) ? -1 : 0;
 }
 
 #define OPEN(name)                                            \
@@ -135,59 +150,64 @@ static void afterLogLine(int fd, const void* data, size_t size) {
 }
 
 ssize_t write(int fd, const void* data, size_t size) {
-  if (fd != STDERR_FILENO && struckFd(fd, 0)) return -1;
+  if (fd != STDERR_FILENO && struckFd("write", fd)) return -1;
   const ssize_t written = REAL(write)(fd, data, size);
   afterLogLine(fd, data, size);
   return written;
 }
 
 ssize_t pwrite64(int fd, const void* data, size_t size, off64_t offset) {
-  if (struckFd(fd, 0)) return -1;
+  if (struckFd("pwrite64", fd)) return -1;
   return REAL(pwrite64)(fd, data, size, offset);
 }
 
 int ftruncate64(int fd, off64_t length) {
-  if (struckFd(fd, 0)) return -1;
+  if (struckFd("ftruncate64", fd)) return -1;
   return REAL(ftruncate64)(fd, length);
 }
 
 int fsync(int fd) {
-  if (struckFd(fd, 1)) return -1;
+  if (struckFd("fsync", fd)) return -1;
   const int result = REAL(fsync)(fd);
   keepDurable(fd);
   return result;
 }
 
 int fdatasync(int fd) {
-  if (struckFd(fd, 1)) return -1;
+  if (struckFd("fdatasync", fd)) return -1;
   const int result = REAL(fdatasync)(fd);
   keepDurable(fd);
   return result;
 }
 
 void* mmap64(void* address, size_t length, int protection, int flags, int fd, off64_t offset) {
-  if (fd >= 0 && (flags & MAP_SHARED) != 0 && struckFd(fd, 0)) return MAP_FAILED;
+  if (fd >= 0 && (flags & MAP_SHARED) != 0 && struckFd("mmap64", fd)) return MAP_FAILED;
   return REAL(mmap64)(address, length, protection, flags, fd, offset);
 }
 
 int rename(const char* from, const char* to) {
-  if (struck(to, 0)) return -1;
+  if (struck("rename", to)) return -1;
   return REAL(rename)(from, to);
 }
 
 int unlink(const char* path) {
-  if (struck(path, 0)) return -1;
+  if (struck("unlink", path)) return -1;
   return REAL(unlink)(path);
 }
 
 int unlinkat(int directory, const char* path, int flags) {
-  if (struck(path, 0)) return -1;
+  if (struck("unlinkat", path)) return -1;
   return REAL(unlinkat)(directory, path, flags);
 }
 
 int mkdir(const char* path, mode_t mode) {
-  if (struck(path, 0)) return -1;
+  if (struck("mkdir", path)) return -1;
   return REAL(mkdir)(path, mode);
+}
+
+int flock(int fd, int operation) {
+  if (struckFd("flock", fd)) return -1;
+  return REAL(flock)(fd, operation);
 }
 
 static long clockIsWrongBy(void) {
@@ -198,13 +218,14 @@ static long clockIsWrongBy(void) {
   if (file < 0) return 0;
   const long length = syscall(SYS_read, (int)file, text, sizeof text - 1);
   syscall(SYS_close, (int)file);
+  if (length > 0) noteStrike();
   return length > 0 ? atol(text) : 0;
 }
 
 enum { kSecond = 1000000000, kMillisecond = 1000000 };
 
-// Nanoseconds that were not waited for: by any thread, by this one. What others time by the steady
-// clock, such as polls of past runs, is not hurried on with it.
+// Nanoseconds that the waits left out: of all threads, and of this thread. The steady clock jumps
+// for the waiting thread only. Otherwise each hurried wait would hurry the polls of past runs too.
 static atomic_long skipped;
 static _Thread_local long skippedHere;
 
@@ -237,6 +258,7 @@ int pthread_cond_clockwait(pthread_cond_t* condition, pthread_mutex_t* mutex, cl
   const struct timespec end = timespecOf(hurried ? nanoseconds(&now) + kMillisecond : deadline);
   const int result = REAL(pthread_cond_clockwait)(condition, mutex, clock, &end);
   if (hurried && result == ETIMEDOUT) {
+    noteStrike();
     atomic_fetch_add(&skipped, remaining - kMillisecond);
     skippedHere += remaining - kMillisecond;
   }
