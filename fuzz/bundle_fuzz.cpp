@@ -1,5 +1,5 @@
-// Any bytes as the metadata of a bundle. An input that begins with 'd' is the name of a desktop
-// file, with 'n' the name of a metadata file, anything else is what a metadata file holds.
+// Any bytes as the metadata of a bundle. An input that begins with 'd' names a desktop file, one
+// that begins with 'n' names a metadata file, and any other is the content of a metadata file.
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -19,15 +19,14 @@ namespace fs = std::filesystem;
 
 const fs::path& directory() {
   static const auto& made = *new fs::path([] {
-    std::string name =
-        fs::is_directory("/dev/shm") ? "/dev/shm/bundle.XXXXXX" : "/tmp/bundle.XXXXXX";
+    std::string name = (fs::temp_directory_path() / "bundle.XXXXXX").string();
     if (::mkdtemp(name.data()) == nullptr) std::abort();
     return name;
   }());
   return made;
 }
 
-// Makes a file; one whose name is none is left out.
+// Makes a file, unless its name is one that no file can have.
 void makeFile(const fs::path& path, std::string_view text) {
   const int file = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
   if (file < 0) return;

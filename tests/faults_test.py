@@ -10,7 +10,6 @@ import os
 import random
 import shutil
 import subprocess
-import sys
 import time
 import unittest
 
@@ -147,7 +146,7 @@ class Disk(FaultTest):
 
     def test_a_disk_without_room_ends_in_counted_losses(self):
         machine = self.machine(some_points(300))
-        script = ('mount -t tmpfs -o size=1m none "$1" && { "$2"; status=$?; cp -a "$1"/. "$3"; '
+        script = ('mount -n -t tmpfs -o size=1m none "$1" && { "$2"; status=$?; cp -a "$1"/. "$3"; '
                   'exit $status; }')
         kept = os.path.join(machine.root, "kept")
         os.mkdir(kept)
@@ -318,7 +317,4 @@ class Kill(FaultTest):
 
 
 if __name__ == "__main__":
-    if not os.path.exists(os.path.join(BIN, "fault_shim.so")):
-        print("skipped: fault_shim.so was not built")
-        sys.exit(harness.SKIPPED)
     harness.main()

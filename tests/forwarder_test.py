@@ -85,7 +85,7 @@ class ForwarderTest(unittest.TestCase):
 
 
 class Delivery(ForwarderTest):
-    def test_a_record_carries_the_event_with_its_kinds_and_order(self):
+    def test_a_record_keeps_kinds_and_order_of_the_event(self):
         self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,'
                          '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open")
         with Receiver() as receiver:
@@ -142,7 +142,7 @@ class Delivery(ForwarderTest):
         self.assertLess(len(request.raw) * 5, len(request.text))
         self.assert_all_arrived_once(receiver, 100)
 
-    def test_a_dry_run_prints_the_very_bodies_and_changes_nothing(self):
+    def test_a_dry_run_prints_the_bodies_and_sends_none(self):
         self.add(700)
         printed = self.run_forwarder(None, "--dry-run").stdout.splitlines()
         self.assertEqual(self.waiting(), 700)
@@ -193,7 +193,7 @@ class Trouble(ForwarderTest):
             self.assertEqual(len(receiver.requests), 1)
             self.assertEqual(self.waiting(), 0)
 
-    def test_a_partial_success_is_counted_and_never_sent_again(self):
+    def test_a_partial_success_is_never_sent_again(self):
         self.add(5)
         body = b'{"partialSuccess":{"rejectedLogRecords":"2","errorMessage":"too old\\n"}}'
         with Receiver(lambda request, number: Answer(200, body)) as receiver:
@@ -203,7 +203,7 @@ class Trouble(ForwarderTest):
         self.assertEqual(self.errors, "statora_forwarder: error: The collector rejected 2 records: too old\n")
         self.assert_all_arrived_once(receiver, 5)
 
-    def test_one_bad_record_is_set_aside_with_the_collectors_words(self):
+    def test_a_bad_record_is_set_aside_with_the_answer(self):
         self.add(1000)
 
         def refuse(request, _):
@@ -224,7 +224,7 @@ class Trouble(ForwarderTest):
         self.assertEqual(receiver.accepted_uids(), [f"{SPOOL_ID}-345"])
         self.assertEqual(self.query("SELECT count(*) FROM forwarder_set_aside"), [(0,)])
 
-    def test_a_row_that_is_no_event_does_not_hold_up_the_others(self):
+    def test_a_row_that_is_no_event_holds_up_no_other(self):
         self.add(1)
         for payload in ("", "[1]", '{"a":{"b":1}}', '{"a":'):
             self.add(1, payload=payload)
@@ -234,7 +234,7 @@ class Trouble(ForwarderTest):
         self.assertEqual(receiver.accepted_uids(), [SPOOL_ID + "-1", SPOOL_ID + "-6"])
         self.assertEqual(self.query("SELECT id FROM forwarder_set_aside ORDER BY id"), [(2,), (3,), (4,), (5,)])
 
-    def test_wrong_credentials_or_address_set_nothing_aside(self):
+    def test_a_refused_sender_sets_nothing_aside(self):
         self.add(600)
         with Receiver() as elsewhere:
             for answer in (Answer(401), Answer(404), Answer(307, headers={"Location": elsewhere.url + "/v1/logs"})):
@@ -263,13 +263,13 @@ class Trouble(ForwarderTest):
 
 
 class Process(ForwarderTest):
-    def test_settings_that_make_no_sense_are_one_line_and_status_78(self):
+    def test_senseless_settings_are_one_line_and_status_78(self):
         result = self.run_forwarder("http://127.0.0.1:9", TESSEL_FORWARD_RATE="-1")
         self.assertEqual(result.returncode, 78)
         self.assertEqual(len(result.stderr.splitlines()), 1)
         self.assertIn("TESSEL_FORWARD_RATE", result.stderr)
 
-    def test_it_tells_the_service_manager_and_ends_when_asked(self):
+    def test_it_notifies_the_manager_and_ends_when_asked(self):
         self.add(3)
         with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as manager, Receiver() as receiver:
             manager.bind(os.path.join(self.state, "notify"))

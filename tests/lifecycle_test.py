@@ -10,7 +10,7 @@ from harness import STATISTICS, MachineTest, interrupt, point, some_points, wait
 
 
 class Launch(MachineTest):
-    def test_a_value_that_makes_no_sense_is_one_line_and_status_78(self):
+    def test_a_senseless_value_is_one_line_and_status_78(self):
         os.rmdir(self.machine.state)
         result = self.machine.run(TESSEL_DEFER_RETRY="15m")
         self.assertEqual(result.status, 78)
@@ -21,7 +21,7 @@ class Launch(MachineTest):
     def test_arguments_are_ignored(self):
         self.assert_clean(self.machine.result(self.machine.start("tessel_reporter", "--help", "x")))
 
-    def test_a_store_that_cannot_be_read_is_named_with_its_reason_and_the_books_are_closed(self):
+    def test_an_unreadable_store_is_named_with_its_reason(self):
         absent = os.path.join(self.machine.root, "nowhere")
         noise = os.path.join(self.machine.root, "noise.journal")
         with open(noise, "wb") as file:
@@ -34,7 +34,7 @@ class Launch(MachineTest):
             self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
             self.assertFalse(self.machine.marker_exists())
 
-    def test_a_state_directory_that_cannot_be_written_to_costs_the_events_and_is_said(self):
+    def test_an_unwritable_state_directory_costs_events(self):
         self.machine.write_journal(some_points(3))
         self.machine.read_only.append(self.machine.state)
         result = self.run_clean()
@@ -59,7 +59,7 @@ class Deferral(MachineTest):
         self.assertEqual(result.log[:2], ["Checking in", "Deferred tessel_reporter"])
         self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
 
-    def test_a_deferral_in_the_middle_stops_the_run_and_is_said(self):
+    def test_a_deferral_in_the_middle_stops_the_run(self):
         self.machine.write_journal(some_points(3000))
         process = self.machine.start()
         wait_for(lambda: self.machine.rows())
@@ -73,7 +73,7 @@ class Deferral(MachineTest):
 
 
 class TwoProcesses(MachineTest):
-    def test_the_second_is_given_the_run_when_the_first_is_done(self):
+    def test_the_second_process_runs_after_the_first(self):
         self.machine.write_journal(some_points(60))
         first = self.machine.start()
         wait_for(self.machine.marker_exists)

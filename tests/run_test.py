@@ -65,7 +65,7 @@ class MixedDay(MachineTest):
                 lines.append("125000.000000 us, 125000000.000000 mach time units per quantum of 10 reported events")
         return lines
 
-    def test_spool_and_log_are_what_the_recorded_points_must_yield(self):
+    def test_spool_and_log_are_what_the_points_yield(self):
         self.machine.write_journal(self.entries)
         result = self.run_clean()
         expected = self.expected()
@@ -82,7 +82,7 @@ class MixedDay(MachineTest):
         throttled = [line for line in result.log if line.startswith("Throttled")]
         self.assertEqual(throttled, [f"Throttled {len(sleeps)} times for a total of {sum(sleeps)} usec"])
 
-    def test_an_internal_build_needs_no_tasking_and_no_whitelist(self):
+    def test_internal_builds_need_no_tasking_or_whitelist(self):
         self.machine.set_internal(True)
         self.machine.task('{"TaskedOn": false}')
         self.machine.write_journal(self.entries)
@@ -98,7 +98,7 @@ class MixedDay(MachineTest):
 
 
 class NotTasked(MachineTest):
-    def test_without_a_configuration_it_waits_sends_nothing_and_leaves_nothing(self):
+    def test_without_a_configuration_it_sends_nothing(self):
         self.machine = harness.Machine()
         self.addCleanup(self.machine.close)
         self.machine.write_export([harness.point("event", "com.vantor.Calendar", "View", "Open")])

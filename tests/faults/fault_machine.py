@@ -39,6 +39,7 @@ class NeverInjected(AssertionError):
 class FaultMachine(Machine):
     def __init__(self, points):
         super().__init__()
+        assert os.path.exists(SHIM), f"{SHIM} was not built"  # the loader only warns about a missing library
         self.task()
         self.durable = os.path.join(self.root, "durable")
         self.struck = os.path.join(self.root, "struck")

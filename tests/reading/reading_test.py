@@ -93,7 +93,7 @@ class Files(ReadingTest):
         os.rename(archived, archived + "~")
         self.assert_all_agree(self.folder, entries=3700, duplicates=1000, files=4)
 
-    def test_a_file_that_may_not_be_read_is_named_and_the_others_are_read(self):
+    def test_a_file_without_permission_is_named(self):
         hidden = self.make("a.journal", exported(10))
         os.chmod(hidden, 0o600)
         os.chmod(self.make("b.journal", exported(10, source=1)), 0o644)
@@ -175,7 +175,7 @@ class Live(ReadingTest):
         with open(os.path.join(LIVE, os.listdir(LIVE)[0], "system.journal"), "rb") as file:
             return file.read(17)[16] == 1
 
-    def test_online_rotated_left_behind_sealed_and_of_users(self):
+    def test_every_kind_of_file_of_a_live_daemon(self):
         for user in (None, 1000, 1001):
             subprocess.run(["systemd-cat"], input=b"line\n" * 50, user=user, check=True)
         self.send(500)
@@ -196,7 +196,7 @@ class Live(ReadingTest):
         self.assertTrue(any(name.endswith(".journal~") for name in os.listdir(os.path.join(LIVE, os.listdir(LIVE)[0]))))
         self.assertGreaterEqual(self.assert_all_agree(LIVE)["entries"], 660)
 
-    def test_a_rotation_while_it_is_read_neither_loses_nor_doubles_a_file(self):
+    def test_a_rotation_neither_loses_nor_doubles_entries(self):
         sent = [0]
 
         # The daemon keeps 100 files, so none is vacuumed here.
