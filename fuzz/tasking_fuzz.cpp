@@ -26,11 +26,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const std::string_view text(reinterpret_cast<const char*>(data), size);
   const auto configuration = parseConfiguration(text);
   const bool decided = taskingDecisionForConfiguration(
-      configuration.get(), "com.vantor.performance.tessel_reporter_tasking");
+                           configuration.get(), "com.vantor.performance.tessel_reporter_tasking")
+                           .on();
   if (decided != mayReport(configuration.get())) std::abort();
   if (decided && text.find("TaskedOn") == std::string_view::npos &&
       text.find('\\') == std::string_view::npos)
     std::abort();
-  if (taskingDecisionForConfiguration(configuration.get(), "com.vantor.other")) std::abort();
+  if (taskingDecisionForConfiguration(configuration.get(), "com.vantor.other").on()) std::abort();
   return 0;
 }

@@ -1,100 +1,131 @@
-// The wait for the tasking configuration and the judgement of it.
+// The rules of tasking, their lines in the log, and the wait for the configuration.
 
 #include "tasking/TaskingGate.h"
 
 #include <atomic>
+#include <iterator>
 
 #include "platform/Log.h"
-#include "platform/Queues.h"
-#include "tasking/TesselReporterConfigObserverDelegate.h"
 
 namespace tessel {
 
 namespace {
 
+// The scheduler's thread waits here. A configuration that exists is delivered in milliseconds; five
+// seconds leave room for a busy machine and still do not hold up the scheduler.
 constexpr std::chrono::nanoseconds kConfigurationWait{5'000'000'000};
 
-// What the waiting gate and the callback share; the callback may outlive the gate's call.
+struct ReasonRow {
+  TaskingReason reason;
+  TaskingSource source;
+  LogFormat<> line;
+};
+
+constexpr ReasonRow kReasons[] = {
+    {TaskingReason::internalBuild, TaskingSource::internalBuild,
+     "Reporting based on os_flavor result"},
+    {TaskingReason::taskedOn, TaskingSource::configuration,
+     "Reporting based on being tasked-on by Statora"},
+    {TaskingReason::taskedOff, TaskingSource::configuration,
+     "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
+    {TaskingReason::noneArrived, TaskingSource::absent,
+     "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"},
+    // The line of this one names the type, which only logDecision() knows.
+    {TaskingReason::unexpectedType, TaskingSource::unusable, ""},
+    {TaskingReason::nilConfiguration, TaskingSource::unusable,
+     "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
+    {TaskingReason::noDictionary, TaskingSource::unusable,
+     "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
+     "object)"},
+    {TaskingReason::noAnswer, TaskingSource::unusable,
+     "Not reporting since is not tasked-on by Statora (nil value for TaskedOn key)"},
+    {TaskingReason::answerNotANumber, TaskingSource::unusable,
+     "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"},
+};
+
+// rowOf() takes the reason for the place in the table.
+static_assert([] {
+  for (size_t place = 0; place < std::size(kReasons); ++place) {
+    if (static_cast<size_t>(kReasons[place].reason) != place) return false;
+  }
+  return std::size(kReasons) == static_cast<size_t>(TaskingReason::answerNotANumber) + 1;
+}());
+
+const ReasonRow& rowOf(TaskingDecision decision) {
+  return kReasons[static_cast<size_t>(decision.reason)];
+}
+
+TaskingDecision logged(TaskingDecision decision, const std::string& type = {}) {
+  if (decision.reason == TaskingReason::unexpectedType) {
+    tesselReporterLog().debug(
+        "Not reporting based on not being tasked-on by Statora (unexpected type string: '%@')",
+        type);
+  } else {
+    tesselReporterLog().debug(rowOf(decision).line);
+  }
+  return decision;
+}
+
+// Shared by the waiting gate and the callback, because the callback may outlive the gate's call.
 struct SharedAnswer {
   Semaphore arrived{0};
-  std::atomic<bool> taskedOn{false};
+  std::atomic<TaskingDecision> decision;
 };
 
 }  // namespace
 
-bool TaskingGate::shouldReport() {
-  if (buildVariant_.hasInternalDiagnostics(kBuildVariantSubsystem)) {
-    tesselReporterLog().debug("Reporting based on os_flavor result");
-    return true;
-  }
-  return awaitTaskingConfiguration();
+TaskingSource TaskingDecision::source() const { return rowOf(*this).source; }
+
+TaskingDecision decideTasking(BuildVariant& buildVariant,
+                              const std::function<TaskingDecision()>& askConfiguration) {
+  if (buildVariant.hasInternalDiagnostics(kBuildVariantSubsystem))
+    return {TaskingReason::internalBuild};
+  return askConfiguration();
 }
 
-bool TaskingGate::awaitTaskingConfiguration() {
+TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* configuration,
+                                                const std::string& type) {
+  if (type != kTaskingType) return {TaskingReason::unexpectedType};
+  if (configuration == nullptr) return {TaskingReason::nilConfiguration};
+  const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
+  if (dictionary == nullptr) return {TaskingReason::noDictionary};
+  const auto answer = dictionary->find(kTaskedOnKey);
+  return taskingDecisionForTaskedOnValue(answer == dictionary->end() ? nullptr : &answer->second);
+}
+
+TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value) {
+  if (value == nullptr) return {TaskingReason::noAnswer};
+  const auto* number = std::get_if<Number>(&value->value);
+  if (number == nullptr) return {TaskingReason::answerNotANumber};
+  return {booleanValue(*number) ? TaskingReason::taskedOn : TaskingReason::taskedOff};
+}
+
+TaskingDecision TaskingGate::decide() {
+  const TaskingDecision decision =
+      decideTasking(buildVariant_, [this] { return awaitTaskingConfiguration(); });
+  // A configuration that arrived was logged on its arrival.
+  const bool arrived = decision.source() == TaskingSource::configuration ||
+                       decision.source() == TaskingSource::unusable;
+  return arrived ? decision : logged(decision);
+}
+
+TaskingDecision TaskingGate::awaitTaskingConfiguration() {
   const auto queue = queues_.makeSerialQueue("tessel_reporter configuration observing queue");
   const auto answer = std::make_shared<SharedAnswer>();
   const auto observer = configurations_.makeObserver();
-  const auto delegate = std::make_shared<TesselReporterConfigObserverDelegate>(
-      [answer](const std::shared_ptr<const ConfigurationValue>& configuration,
-               const std::string& type) {
-        answer->taskedOn = taskingDecisionForConfiguration(configuration.get(), type);
-        answer->arrived.signal();
-      });
-  observer->setDelegate(delegate, queue);
-  observer->startObserving(kTaskingType);
-  if (!clock_.wait(answer->arrived, kConfigurationWait)) {
-    tesselReporterLog().debug(
-        "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)");
-    return false;
-  }
-  return answer->taskedOn;
-}
-
-bool taskingDecisionForConfiguration(const ConfigurationValue* configuration,
+  observer->setDelegate(std::make_shared<TesselReporterConfigObserverDelegate>(
+                            [answer](const std::shared_ptr<const ConfigurationValue>& configuration,
                                      const std::string& type) {
-  if (type != kTaskingType) {
-    tesselReporterLog().debug(
-        "Not reporting based on not being tasked-on by Statora (unexpected type string: '%@')",
-        type);
-    return false;
-  }
-  if (configuration == nullptr) {
-    tesselReporterLog().debug(
-        "Not reporting based on not being tasked-on by Statora (nil configuration object)");
-    return false;
-  }
-  const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
-  if (dictionary == nullptr) {
-    tesselReporterLog().debug(
-        "Not reporting based on not being tasked-on by Statora (Non-KVDictionary configuration "
-        "object)");
-    return false;
-  }
-  const auto taskedOn = dictionary->find(kTaskedOnKey);
-  return taskingDecisionForTaskedOnValue(taskedOn == dictionary->end() ? nullptr
-                                                                       : &taskedOn->second);
-}
-
-bool taskingDecisionForTaskedOnValue(const ConfigurationValue* value) {
-  if (value == nullptr) {
-    tesselReporterLog().debug(
-        "Not reporting since is not tasked-on by Statora (nil value for %@ key)", kTaskedOnKey);
-    return false;
-  }
-  const auto* number = std::get_if<Number>(&value->value);
-  if (number == nullptr) {
-    tesselReporterLog().debug(
-        "Not reporting since not tasked-on by Statora (Wrong value class for class for %@)",
-        kTaskedOnKey);
-    return false;
-  }
-  if (booleanValue(*number)) {
-    tesselReporterLog().debug("Reporting based on being tasked-on by Statora");
-    return true;
-  }
-  tesselReporterLog().debug("Not reporting based on not being tasked-on by Statora ('%@' is false)",
-                            kTaskedOnKey);
-  return false;
+                              // Several may arrive before the gate looks. The last one decides,
+                              // since it is newest.
+                              answer->decision = logged(
+                                  taskingDecisionForConfiguration(configuration.get(), type), type);
+                              answer->arrived.signal();
+                            }),
+                        queue);
+  observer->startObserving(kTaskingType);
+  if (!clock_.wait(answer->arrived, kConfigurationWait)) return {TaskingReason::noneArrived};
+  return answer->decision;
 }
 
 }  // namespace tessel

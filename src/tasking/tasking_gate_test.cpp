@@ -25,14 +25,14 @@ std::string notReporting(const std::string& reason) {
 class TaskingGateTest : public ::testing::Test {
  protected:
   // Delivers the configurations while the gate waits.
-  bool ask(
+  TaskingDecision ask(
       std::vector<std::pair<std::shared_ptr<const ConfigurationValue>, std::string>> deliveries) {
     clock.whileWaiting = [this, deliveries = std::move(deliveries)] {
       for (const auto& [value, type] : deliveries)
         configurations.observers.back()->deliver(value, type);
       queues.runAll();
     };
-    return gate.shouldReport();
+    return gate.decide();
   }
 
   testing::RecordingLog log;
@@ -45,15 +45,17 @@ class TaskingGateTest : public ::testing::Test {
 
 TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
   variant.internal = true;
-  EXPECT_TRUE(gate.shouldReport());
+  const TaskingDecision decision = gate.decide();
+  EXPECT_TRUE(decision.on());
+  EXPECT_EQ(decision.source(), TaskingSource::internalBuild);
   EXPECT_EQ(log.lines(), std::vector<std::string>{"Reporting based on os_flavor result"});
   EXPECT_EQ(variant.lastSubsystem, "com.vantor.tessel");
   EXPECT_TRUE(configurations.observers.empty());
   EXPECT_TRUE(queues.queues.empty());
 }
 
-TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSeconds) {
-  EXPECT_FALSE(gate.shouldReport());
+TEST_F(TaskingGateTest, ObservesOneTypeAndTimesOutAfterFiveSeconds) {
+  EXPECT_EQ(gate.decide().source(), TaskingSource::absent);
   EXPECT_EQ(log.lines(), std::vector{notReporting("Timeout waiting for config")});
   EXPECT_EQ(clock.waits, std::vector<std::chrono::nanoseconds>{std::chrono::seconds{5}});
   EXPECT_EQ(configurations.observers.at(0)->observed, std::vector<std::string>{kType});
@@ -61,7 +63,7 @@ TEST_F(TaskingGateTest, ObservesOneTypeOnAQueueOfItsOwnAndTimesOutAfterFiveSecon
             "tessel_reporter configuration observing queue");
 }
 
-TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
+TEST_F(TaskingGateTest, EachConfigurationHasItsDecisionAndLine) {
   const char* kOn = "Reporting based on being tasked-on by Statora";
   const std::string kOff = notReporting("'TaskedOn' is false");
   const std::string kNoDictionary = notReporting("Non-KVDictionary configuration object");
@@ -86,17 +88,20 @@ TEST_F(TaskingGateTest, EveryConfigurationHasItsOutcomeAndItsLine) {
   };
   for (const auto& c : cases) {
     log.clear();
-    EXPECT_EQ(ask({{c.value, c.type}}), c.line == kOn) << c.line;
+    const TaskingDecision decision = ask({{c.value, c.type}});
+    EXPECT_EQ(decision.on(), c.line == kOn) << c.line;
     EXPECT_EQ(log.lines(), std::vector{c.line});
+    const bool answered = c.line == kOn || c.line == kOff;
+    EXPECT_EQ(decision.source(), answered ? TaskingSource::configuration : TaskingSource::unusable);
   }
 }
 
-TEST_F(TaskingGateTest, OfSeveralConfigurationsTheLastBeforeTheReadDecides) {
-  EXPECT_TRUE(ask({{nullptr, kType}, {taskedOn({Number{true}}), kType}}));
-  EXPECT_FALSE(ask({{taskedOn({Number{true}}), kType}, {taskedOn({Number{false}}), kType}}));
+TEST_F(TaskingGateTest, TheLastOfSeveralConfigurationsDecides) {
+  EXPECT_TRUE(ask({{nullptr, kType}, {taskedOn({Number{true}}), kType}}).on());
+  EXPECT_FALSE(ask({{taskedOn({Number{true}}), kType}, {taskedOn({Number{false}}), kType}}).on());
 }
 
-TEST_F(TaskingGateTest, AConfigurationAfterTheTimeoutIsLoggedAndTheNextCallAsksAfresh) {
+TEST_F(TaskingGateTest, ALateConfigurationIsLoggedAndChangesNothing) {
   EXPECT_FALSE(gate.shouldReport());
   log.clear();
   configurations.observers.at(0)->deliver(taskedOn({Number{true}}), kType);

@@ -64,8 +64,8 @@ std::string statusJson(const ReporterStatus& status) {
   return objectLine([&](JsonWriter& json) {
     json.member("good", status.good());
     json.object("tasking", [&] {
-      json.member("tasked", status.tasking.on);
-      json.member("source", taskingSourceName(status.tasking.source));
+      json.member("tasked", status.tasking.decision.on());
+      json.member("source", taskingSourceName(status.tasking.decision.source()));
       json.member("file", status.tasking.file);
     });
     json.object("deferral", [&] {
@@ -96,8 +96,8 @@ class Screen {
       : status_(status), terminal_(terminalBehind(STDOUT_FILENO)) {}
 
   std::string render() {
-    line("Tasking", status_.tasking.on ? "on" : "off",
-         status_.tasking.on ? Colour::good : Colour::caution, status_.taskingWords);
+    line("Tasking", status_.tasking.decision.on() ? "on" : "off",
+         status_.tasking.decision.on() ? Colour::good : Colour::caution, status_.taskingWords);
     line("Deferral", status_.deferral ? "wanted" : "none",
          status_.deferral ? Colour::caution : Colour::plain,
          status_.deferral.value_or("nothing speaks against a run now"));

@@ -35,12 +35,14 @@ int show(const LaunchConfiguration& launch, bool json) {
   const Tasking tasking = askTasking(launch);
   if (json) {
     print(objectLine([&](JsonWriter& writer) {
-      writer.member("tasked", tasking.on).member("source", taskingSourceName(tasking.source));
+      writer.member("tasked", tasking.decision.on())
+          .member("source", taskingSourceName(tasking.decision.source()));
       writer.member("file", tasking.file);
     }));
   } else {
     const Terminal terminal = terminalBehind(1);
-    print(terminal.paint(tasking.on ? Colour::good : Colour::caution, tasking.on ? "on" : "off") +
+    print(terminal.paint(tasking.decision.on() ? Colour::good : Colour::caution,
+                         tasking.decision.on() ? "on" : "off") +
           ": " + terminalText(taskingWords(tasking, launch)) + "\n");
   }
   return kDone;

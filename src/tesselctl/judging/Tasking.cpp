@@ -1,4 +1,4 @@
-// Asking what the gate asks.
+// Asking what the gate asks, without its wait.
 
 #include "tesselctl/judging/Tasking.h"
 
@@ -7,59 +7,34 @@
 #include "linux/SystemFacts.h"
 #include "os/Files.h"
 #include "statora/ConfigurationFiles.h"
-#include "tasking/TaskingGate.h"
 
 namespace tessel::ctl {
-
-namespace {
-
-bool saysWhetherTasked(const ConfigurationValue* configuration) {
-  if (configuration == nullptr) return false;
-  const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
-  if (dictionary == nullptr) return false;
-  const auto found = dictionary->find(kTaskedOnKey);
-  return found != dictionary->end() && std::holds_alternative<Number>(found->second.value);
-}
-
-}  // namespace
 
 std::string taskingFile(const LaunchConfiguration& launch) {
   return launch.configurationDirectory + "/" + kTaskingType + ".json";
 }
 
 Tasking askTasking(const LaunchConfiguration& launch) {
-  Tasking tasking;
-  tasking.file = taskingFile(launch);
-  if (OsReleaseBuildVariant(launch.osReleasePath).hasInternalDiagnostics(kBuildVariantSubsystem)) {
-    tasking.on = true;
-    tasking.source = TaskingSource::internalBuild;
-    return tasking;
-  }
-  if (::access(tasking.file.c_str(), F_OK) != 0) return tasking;
-  const auto text = readSmallFile(tasking.file, FileConfigurationService::kMaxFileBytes);
-  const auto configuration = text ? parseConfiguration(*text) : nullptr;
-  tasking.on = taskingDecisionForConfiguration(configuration.get(), kTaskingType);
-  tasking.source = saysWhetherTasked(configuration.get()) ? TaskingSource::configuration
-                                                          : TaskingSource::unusable;
-  return tasking;
+  const std::string file = taskingFile(launch);
+  OsReleaseBuildVariant variant(launch.osReleasePath);
+  const TaskingDecision decision = decideTasking(variant, [&]() -> TaskingDecision {
+    // Nothing is delivered for a file that is not there, so the gate would wait in vain.
+    if (::access(file.c_str(), F_OK) != 0) return {TaskingReason::noneArrived};
+    const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
+    const auto configuration = text ? parseConfiguration(*text) : nullptr;
+    return taskingDecisionForConfiguration(configuration.get(), kTaskingType);
+  });
+  return {decision, file};
 }
 
 std::string_view taskingSourceName(TaskingSource source) {
-  switch (source) {
-    case TaskingSource::internalBuild:
-      return "internal_build";
-    case TaskingSource::configuration:
-      return "configuration";
-    case TaskingSource::absent:
-      return "absent";
-    case TaskingSource::unusable:
-      break;
-  }
-  return "unusable";
+  static constexpr std::string_view kNames[] = {"internal_build", "configuration", "absent",
+                                                "unusable"};
+  return kNames[static_cast<size_t>(source)];
 }
 
 std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& launch) {
-  switch (tasking.source) {
+  switch (tasking.decision.source()) {
     case TaskingSource::internalBuild:
       return launch.osReleasePath + " says that this is an internal build";
     case TaskingSource::configuration:

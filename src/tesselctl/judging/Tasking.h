@@ -1,27 +1,20 @@
 // Tasking: whether this machine reports, and what says so.
 //
-// The answer is worked out from the same files by the same rules as the service's gate. Stateless.
+// The service's own rules decide, from the same files. Stateless.
 
 #pragma once
 
-#include <optional>
 #include <string>
+#include <string_view>
 
 #include "linux/LaunchConfiguration.h"
+#include "tasking/TaskingGate.h"
 
 namespace tessel::ctl {
 
-enum class TaskingSource {
-  internalBuild,  // the operating system says that it is an internal build
-  configuration,  // the tasking configuration says yes or no
-  absent,         // there is no tasking configuration
-  unusable,       // there is a file, but it is no configuration or does not say
-};
-
 struct Tasking {
-  bool on = false;
-  TaskingSource source = TaskingSource::absent;
-  std::string file;  // of the configuration
+  TaskingDecision decision;
+  std::string file;  // of the configuration, there or not
 };
 
 std::string taskingFile(const LaunchConfiguration& launch);
