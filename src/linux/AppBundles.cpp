@@ -1,4 +1,8 @@
 // Reading bundle metadata.
+//
+// An identifier decides what may be reported, so a doubtful one is worse than none: two files of a
+// kind may contradict each other, and the order of a directory would then choose. The directories
+// belong to whoever installed the application, so every size is bounded.
 
 #include "linux/AppBundles.h"
 
@@ -15,9 +19,9 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxMetadataSize = size_t{1} << 20;
-constexpr size_t kMaxIdentifierLength = 255;
-constexpr size_t kMaxDirectoryEntries = 10'000;
+constexpr size_t kMaxMetadataSize = size_t{1} << 20;  // usual ones have a few kilobytes
+constexpr size_t kMaxIdentifierLength = 255;          // of a D-Bus name
+constexpr size_t kMaxDirectoryEntries = 10'000;       // a root with more is no application's
 
 bool isLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
 bool isDigit(char c) { return c >= '0' && c <= '9'; }
@@ -35,7 +39,8 @@ bool isLabel(std::string_view label) {
          std::all_of(label.begin(), label.end(), isIdentifierCharacter);
 }
 
-// Two labels or more, as in a D-Bus name.
+// Two labels or more, as in a D-Bus name. "firefox.desktop" names no bundle: any program may be
+// called that.
 bool isReverseDns(std::string_view name) {
   if (name.size() > kMaxIdentifierLength || name.find('.') == std::string_view::npos) return false;
   for (;;) {
@@ -52,8 +57,8 @@ bool hasSuffix(std::string_view name, const std::vector<std::string_view>& suffi
                      [&](std::string_view suffix) { return name.ends_with(suffix); });
 }
 
-// Paths of the files in `directory` with one of `suffixes`, at most two. Of a directory with an
-// absurd number of entries, those that come first.
+// The files in `directory` with one of `suffixes`. At most two, because two are already too many. A
+// directory with too many entries is read in part.
 std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& directory,
                                                    const std::vector<std::string_view>& suffixes) {
   std::vector<std::filesystem::path> found;
@@ -71,7 +76,7 @@ std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& 
   return found;
 }
 
-// The parser lets several roots pass, and text beside a root.
+// The parser accepts several roots and text beside a root, neither of which is well-formed.
 bool hasOneRoot(const pugi::xml_document& document) {
   const auto isElement = [](const pugi::xml_node& node) {
     return node.type() == pugi::node_element;

@@ -1,13 +1,13 @@
 // AppBundles: the identifier of an application's directory.
 //
-// A directory's identifier is the AppStream component id in the one metadata file of its
-// usr/share/metainfo (*.metainfo.xml, *.appdata.xml). Without such a file it is the name of the one
-// *.desktop file at its root, where that is in reverse-DNS form. Several files of a kind name no
-// bundle, and neither does a metadata file that is over 1 MiB, is not well-formed, or has no valid
-// component id: a desktop file beside it then does not count.
+// The identifier is the AppStream component id in the one metadata file of the directory's
+// usr/share/metainfo (*.metainfo.xml, *.appdata.xml). If there is no such file, it is the name of
+// the one *.desktop file at the directory's root, provided that the name has reverse-DNS form. A
+// directory with several files of a kind has no identifier. Neither has one whose metadata file is
+// over 1 MiB, not well-formed, or without a valid id; a desktop file beside it does not help then.
 //
-// What is read was put there by strangers: links to files are followed, anything but a regular file
-// is left alone, and entities of an XML file are not expanded. Stateless; any thread.
+// Strangers made these files. Links to files are followed, only regular files are opened, and
+// entities of an XML file are not expanded. Stateless; any thread.
 
 #pragma once
 

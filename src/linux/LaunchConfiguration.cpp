@@ -1,4 +1,7 @@
 // Reading the launch variables.
+//
+// A value without sense ends the process before it has done anything. To go on with the default was
+// discarded: an operator who mistypes an interval would learn of it from missing data, weeks later.
 
 #include "linux/LaunchConfiguration.h"
 
@@ -12,9 +15,9 @@ namespace tessel {
 
 namespace {
 
-// A year: longer waits are typing mistakes, and every sum of times stays far from overflow.
+// A year. A longer wait is a typing mistake, and sums of such times are far from overflow.
 constexpr int64_t kMaxSeconds = 31'536'000;
-constexpr size_t kMaxQuotedValue = 256;
+constexpr size_t kMaxQuotedValue = 256;  // so that the error stays one readable line
 constexpr std::string_view kBlanks = " \t";
 
 std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
@@ -43,7 +46,8 @@ std::optional<DeferSources> deferSources(std::string_view list) {
   }
 }
 
-// The first of the directories that the service manager made for the service.
+// The first of the directories that the service manager made for the service. The manager joins
+// them with colons, in the order of the unit file.
 std::optional<std::string> managedDirectory(const EnvironmentReader& environment,
                                             const std::string& name) {
   const std::optional<std::string> list = environment(name);
@@ -53,12 +57,12 @@ std::optional<std::string> managedDirectory(const EnvironmentReader& environment
   return first;
 }
 
-// Reads the variables one after another and remembers the first that makes no sense.
+// Reads the variables one after another and keeps the first error.
 class VariableReader {
  public:
   explicit VariableReader(const EnvironmentReader& environment) : environment_(environment) {}
 
-  // Gives `target` the value that `parse` makes of the variable, where it is set.
+  // If the variable is set, gives `target` the value that `parse` makes of it.
   template <typename Target, typename Parse>
   void read(const std::string& variable, Target& target, const char* expected, Parse parse) {
     const std::optional<std::string> text = environment_(variable);
@@ -111,6 +115,7 @@ std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
   if (auto managed = managedDirectory(environment, "CONFIGURATION_DIRECTORY")) {
     configuration.configurationDirectory = *managed;
   }
+  // Our own variables come after the manager's directories, so they win.
   VariableReader variables(environment);
   variables.readPath("TESSEL_TRACE_STORE", configuration.traceStore);
   variables.readPath("TESSEL_STATE_DIR", configuration.stateDirectory);

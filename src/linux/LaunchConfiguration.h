@@ -1,5 +1,5 @@
-// LaunchConfiguration: what the environment says about this process, read once before anything is
-// started. A plain value, safe to share once made.
+// LaunchConfiguration: what the environment says about this process. It is read once, before
+// anything is started. A plain value; any thread.
 
 #pragma once
 
@@ -15,14 +15,14 @@
 namespace tessel {
 
 // Exit statuses of the service besides 0, as in sysexits.h.
-inline constexpr int kExitConfiguration = 78;   // a launch variable makes no sense
+inline constexpr int kExitConfiguration = 78;   // a launch variable has a value without sense
 inline constexpr int kExitStateDirectory = 73;  // the state directory cannot be used
 
 // What may defer a run.
 struct DeferSources {
-  bool file = false;      // <state>/defer exists
-  bool battery = false;   // on battery, and it is low
-  bool pressure = false;  // tasks wait for the CPU
+  bool file = false;      // the file <state>/defer
+  bool battery = false;   // a low battery while the machine runs on it
+  bool pressure = false;  // tasks that wait for the CPU
 
   bool operator==(const DeferSources&) const = default;
 };
@@ -41,20 +41,20 @@ struct LaunchConfiguration {
   std::string osReleasePath = "/etc/os-release";
 };
 
-// A launch variable that makes no sense.
+// A variable whose value makes no sense.
 struct LaunchError {
   std::string variable;
   std::string value;
   std::string expected;  // what would make sense
 
-  // One line without a line feed, fit for a terminal, that names variable and value.
+  // One line that names variable and value. It has no line feed and is fit for a terminal.
   std::string line() const;
 };
 
-// The value of an environment variable; nothing where it is not set.
+// The value of an environment variable. Absent if it is not set.
 using EnvironmentReader = std::function<std::optional<std::string>(const std::string& name)>;
 
-// Reads every launch variable; the first one that makes no sense is the error. Touches nothing but
+// Reads every launch variable. The error is the first one that makes no sense. Touches nothing but
 // the reader.
 std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
     const EnvironmentReader& environment);

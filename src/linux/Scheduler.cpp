@@ -1,4 +1,18 @@
 // Deferral by file, battery and CPU pressure; deliveries to the activity.
+//
+// Several processes may use one state directory: the timer's, a second service, an operator's. Two
+// things keep them apart, a lock and a record.
+//  - A run is delivered under an exclusive flock() on the directory. The kernel drops it when the
+//    process dies, however it dies. A lock file with a process id was discarded: after a kill it
+//    stays, and the id may by then be another process's.
+//  - The record says when the last run began. A run is due when that is an interval ago. Who waited
+//    for the lock looks at the record again, because the run may have taken place meanwhile.
+// The begin counts and not the end, so that runs keep their distance however long one takes. The
+// record is written after the run: a run that dies is not recorded, and the next process repeats it
+// (the run marker then says so). Writing it before would skip a day after each crash.
+//
+// The wall clock may jump and the machine may sleep. No single wait therefore exceeds a minute,
+// after which both clocks are read again.
 
 #include "linux/Scheduler.h"
 
@@ -20,11 +34,13 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxFactSize = 4096;  // sysfs and procfs files of this kind fit a page
+constexpr size_t kMaxFactSize = 4096;  // the kernel writes files of this kind into one page
+// Below this most desktops warn of a low battery.
 constexpr int kLowBatteryPercent = 20;
+// Tasks waited for the CPU in 80 of 100 moments of the last ten seconds. A run would lengthen them.
 constexpr double kHighPressurePercent = 80;
 
-// The fact in a one-line file; empty where there is none.
+// The content of a one-line file. Empty if there is none.
 std::string fact(const std::string& path) {
   std::string text = readSmallFile(path, kMaxFactSize).value_or("");
   while (text.ends_with('\n')) text.pop_back();
@@ -48,13 +64,15 @@ std::vector<std::string> entriesOf(const std::string& directory) {
   return paths;
 }
 
-// A battery that feeds the machine; those of mice and headsets have the scope "Device".
+// Whether a power supply is a battery that feeds the machine. A mouse or a headset also reports a
+// battery, with the scope "Device". "present" is 0 in an empty slot.
 bool feedsTheMachine(const std::string& supply) {
   return fact(supply + "/type") == "Battery" && fact(supply + "/scope") != "Device" &&
          fact(supply + "/present") != "0";
 }
 
-// The number behind "avg10=" in the line of `text` that begins with "some ".
+// The number behind "avg10=" in the line "some". The line "full" has an average, too, but it stays
+// at zero for the CPU of a whole machine.
 std::optional<double> someAverage10(std::string_view text) {
   constexpr std::string_view kBefore = "some avg10=";
   const size_t at = text.starts_with(kBefore) ? 0 : text.find("\nsome avg10=");
@@ -80,11 +98,13 @@ std::optional<std::string> DeferralConditions::reason() const {
 }
 
 bool DeferralConditions::deferFileExists() const {
+  // lstat, so that a link that leads nowhere defers as well.
   struct stat facts {};
   return ::lstat(deferFile_.c_str(), &facts) == 0;
 }
 
-// A machine with several batteries drains one after another: it is low when all of them are.
+// A machine with several batteries empties one after another, so its charge is low only if all of
+// them are.
 bool DeferralConditions::batteryIsLow() const {
   bool discharging = false;
   for (const std::string& supply : entriesOf(powerSupplyDirectory_)) {
@@ -103,10 +123,11 @@ bool DeferralConditions::cpuIsUnderPressure() const {
 
 namespace {
 
-// Longest single wait: the wall clock and the time spent asleep are looked at this often.
+// The longest single wait. The wall clock and the time that the machine slept are read this often.
 constexpr std::chrono::nanoseconds kLongestWait = std::chrono::minutes{1};
 
-// One delivery to the activity. The state may change to "defer" while a run is being delivered.
+// One delivery to the activity. The service asks from several threads, hence the lock. After end()
+// the delivery takes no state, because nobody would act on it.
 class Delivery final : public Activity {
  public:
   Delivery(int64_t state, const DeferralConditions& conditions)
@@ -123,7 +144,7 @@ class Delivery final : public Activity {
     state_ = wanted;
     return true;
   }
-  // Takes no state from here on. True where the run was deferred.
+  // Takes no state from here on. True if the run was deferred.
   bool end() {
     const std::lock_guard lock(mutex_);
     over_ = true;
@@ -151,6 +172,7 @@ BackgroundScheduler::BackgroundScheduler(ScheduleCriteria criteria, const StateD
       clock_(clock) {}
 
 void BackgroundScheduler::registerActivity(const std::string& /*name*/, ActivityHandler handler) {
+  // The process may not end while a delivery is pending; the thread holds that until it ends.
   std::thread([pending = runtime_.expectDelivery(),
                deliveries = ActivityDeliveries(criteria_, state_, conditions_, status_, clock_,
                                                std::move(handler))]() mutable {
@@ -182,6 +204,7 @@ bool ActivityDeliveries::deliverRun() {
   const auto delivery = std::make_shared<Delivery>(kActivityStateRun, conditions_);
   handler_(delivery);
   if (delivery->end()) {
+    // Give the lock back before the wait: another process may have a better moment.
     turn.reset();
     status_.say("run deferred: " + conditions_.reason().value_or("no reason any more"));
     waitForRetry();
@@ -201,7 +224,7 @@ RunLock ActivityDeliveries::waitForTurn() {
     } else if (!criteria_.interval || lastRun() == lastRunSeen) {
       return std::move(*turn);
     }
-    // Else another process ran in the meantime, and the run is not due any more.
+    // Otherwise another process ran while this one waited for the lock, and its run is not due.
   }
 }
 
@@ -211,7 +234,8 @@ std::optional<RunLock> ActivityDeliveries::waitForLock() {
   return state_.waitForLock();
 }
 
-// Answers the last run that the decision rests on; the holder of the lock sees whether it still is.
+// Answers the last run on which the decision rests. Whoever gets the lock then sees whether that is
+// still the last run.
 std::optional<Date> ActivityDeliveries::waitUntilDue() {
   const std::optional<Date> seen = lastRun();
   if (!criteria_.interval) return seen;
@@ -225,7 +249,8 @@ std::optional<Date> ActivityDeliveries::waitUntilDue() {
   }
 }
 
-// The record, or a later run of this process's own that could not be recorded.
+// The record, or a later run of this process. A directory that cannot be written must not make the
+// service run again and again.
 std::optional<Date> ActivityDeliveries::lastRun() const {
   return std::max(state_.lastRun(), lastRunHere_);
 }
@@ -247,6 +272,7 @@ void ActivityDeliveries::waitForRetry() {
 }
 
 void ActivityDeliveries::wait(std::chrono::nanoseconds duration) {
+  // Nobody signals it, so this only sleeps, by a clock that tests can move.
   Semaphore never(0);
   clock_.wait(never, duration);
 }

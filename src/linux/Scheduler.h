@@ -15,19 +15,17 @@
 
 namespace tessel {
 
-// DeferralConditions: whether now is a bad time for a run.
-//
-// Each question is answered from files at the moment it is asked. A file that is missing, cannot be
-// read or makes no sense never defers. Immutable; any thread may ask.
-
+// Says whether now is a bad time for a run. It reads files at the moment it is asked. A file that
+// is missing, cannot be read or makes no sense never defers: a service that waits for ever would be
+// worse than one that runs at a bad time. Immutable; any thread may ask.
 class DeferralConditions {
  public:
-  // `deferFile` defers by being there. The other two are the kernel's, elsewhere in tests.
+  // `deferFile` defers by existing. The other two paths are the kernel's; tests have their own.
   DeferralConditions(DeferSources sources, std::string deferFile,
                      std::string powerSupplyDirectory = "/sys/class/power_supply",
                      std::string pressureFile = "/proc/pressure/cpu");
 
-  // Why a run should wait, in words; nothing where it need not.
+  // Why a run should wait, in words. Absent if it need not.
   std::optional<std::string> reason() const;
 
  private:
@@ -41,42 +39,34 @@ class DeferralConditions {
   const std::string pressureFile_;
 };
 
-// When the next run is due, as plain arithmetic.
-
-// How long to wait for the run that comes `interval` after the one that began at `lastRun`; zero
-// where it is due. `waited` is how long this wait has lasted, by a clock that nobody sets: however
-// the wall clock is set meanwhile, or stands before the last run, no wait exceeds the interval.
+// How long to wait for the run that comes `interval` after the one that began at `lastRun`. Zero if
+// it is due. `waited` is how long this wait has lasted already, by a clock that nobody can set. It
+// bounds the wait by the interval, whatever happens to the wall clock meanwhile.
 inline std::chrono::nanoseconds waitForRun(std::optional<Date> lastRun, Date now,
                                            std::chrono::seconds interval,
                                            std::chrono::nanoseconds waited) {
   using std::chrono::nanoseconds;
   const auto sinceLastRun = lastRun ? now - *lastRun : Date::duration::max();
   if (sinceLastRun >= interval) return nanoseconds{0};
-  // A run in the future tells nothing: the whole interval is waited for.
+  // A last run in the future says nothing, so the whole interval is waited for.
   const nanoseconds byWallClock = interval - std::max(sinceLastRun, Date::duration::zero());
   return std::clamp(interval - waited, nanoseconds{0}, byWallClock);
 }
 
-// BackgroundScheduler: delivers check-in and runs to the one activity of the process.
-//
-// The check-in comes first. Without an interval one run follows at once, and when it is over
-// nothing is pending any more. With an interval a run follows whenever that much time has passed
-// since the last one began, by the record in the state directory, so there is always one pending.
-// A run is delivered under the state directory's lock; a process that has to wait for the lock gets
-// its run afterwards, if it is still due. A deferred run is not recorded and is offered again after
-// the retry time.
-//
-// An activity takes one state: 3 (defer), once, while its run is being delivered.
-//
-// The handler is called on one thread, made by registerActivity(), which lives as long as there is
-// something pending. Everything given to the constructor must outlive the scheduler, and the
-// scheduler its thread: all live as long as the process.
-
 struct ScheduleCriteria {
-  std::optional<std::chrono::seconds> interval;
+  std::optional<std::chrono::seconds> interval;  // absent: one run, then nothing is pending
   std::chrono::seconds deferRetry{900};
 };
 
+// Delivers the check-in and then runs to the one activity of the process.
+//
+// Without an interval one run follows the check-in at once. With an interval a run follows whenever
+// that much time has passed since the last one began. An activity takes one state, defer, once,
+// while its run is being delivered. A deferred run is offered again after the retry time.
+//
+// Threads: registerActivity() makes one thread, which calls the handler and lives as long as
+// something is pending. The scheduler and everything given to its constructor live as long as the
+// process.
 class BackgroundScheduler final : public ActivityScheduler {
  public:
   BackgroundScheduler(ScheduleCriteria criteria, const StateDirectory& state,
@@ -95,7 +85,7 @@ class BackgroundScheduler final : public ActivityScheduler {
   Clock& clock_;
 };
 
-// What the scheduler's thread does, step by step; one thread at a time.
+// What the scheduler's thread does, step by step. Threads: one at a time.
 class ActivityDeliveries {
  public:
   ActivityDeliveries(ScheduleCriteria criteria, const StateDirectory& state,
@@ -103,8 +93,8 @@ class ActivityDeliveries {
                      ActivityHandler handler);
 
   void deliverCheckIn();
-  // Waits until a run is due and nobody else runs, and delivers it. False when no further delivery
-  // is pending.
+  // Waits until a run is due and no other process runs, and delivers it. False if no further
+  // delivery is pending.
   bool deliverRun();
 
  private:
@@ -123,7 +113,7 @@ class ActivityDeliveries {
   ServiceStatus& status_;
   Clock& clock_;
   const ActivityHandler handler_;
-  std::optional<Date> lastRunHere_;
+  std::optional<Date> lastRunHere_;  // the last run of this process, in case it was not recorded
 };
 
 }  // namespace tessel

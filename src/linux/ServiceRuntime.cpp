@@ -1,4 +1,11 @@
 // Process setup, the notification protocol, signals on a thread, the life of the process.
+//
+// A signal is taken by a thread in sigwait() and becomes a closure on a queue. A signal handler was
+// discarded, because next to nothing may be called in one; so was signalfd, which would need an
+// event loop that the service has no other use for.
+//
+// The process ends in one place, runMainLoop(), by exit(0) while detached threads may still run;
+// see Queues.cpp for why that is safe.
 
 #include "linux/ServiceRuntime.h"
 
@@ -7,12 +14,12 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
-#include <cassert>
 #include <csignal>
 #include <cstdlib>
 #include <thread>
 #include <utility>
 
+#include "platform/Invariant.h"
 #include "platform/Text.h"
 
 namespace tessel {
@@ -22,16 +29,16 @@ namespace {
 void fillStandardDescriptors() {
   // open() answers the lowest free number, so each call fills one gap or lands above them.
   for (;;) {
-    const int fd =
-        ::open("/dev/null", O_RDWR);  // kept open: inherited like any standard descriptor
+    // Without O_CLOEXEC: children inherit it like any standard descriptor.
+    const int fd = ::open("/dev/null", O_RDWR);
     if (fd > STDERR_FILENO) ::close(fd);
     if (fd < 0 || fd > STDERR_FILENO) return;
   }
 }
 
-// A run's large blocks are mapped apart and go back when they are freed, where the C library would
-// move its threshold up and keep them; and the few threads share two heaps, so that what one thread
-// frees is used by the next.
+// Blocks from 128 KiB on get a mapping of their own, which goes back to the system when it is
+// freed. A fixed threshold keeps the C library from raising it after the first large block. Two
+// heaps for all threads, and not one for each, so that a thread can use what another one freed.
 void keepHeapSmall() {
   constexpr int kLargeBlockBytes = 128 << 10;
   constexpr int kHeaps = 2;
@@ -56,8 +63,9 @@ void prepareProcess() {
 }
 
 namespace {
+// The manager advises two signs of life a period. With four a late one does not end the process.
 constexpr int kFeedsPerWatchdogPeriod = 4;
-}
+}  // namespace
 
 ServiceManager::ServiceManager(Clock& clock, Notify notify, std::chrono::nanoseconds watchdog)
     : clock_(clock),
@@ -83,7 +91,9 @@ void ServiceManager::progress() {
   if (feedInterval_.count() > 0 && takeFeed()) notify_("WATCHDOG=1");
 }
 
-// True for one of the callers, once a feed interval has passed since the last true.
+// True for one of the callers once a feed interval has passed since the last true. Without a lock,
+// because the reader of a run calls it for every trace object. Relaxed order is enough: the time
+// alone is shared.
 bool ServiceManager::takeFeed() {
   const Timebase base = clock_.timebase();
   const uint64_t now = clock_.continuousTicks();
@@ -124,14 +134,14 @@ void ThreadSignalSource::setHandler(Closure handler) { handler_ = std::move(hand
 
 void ThreadSignalSource::resume() {
   if (!queue_) return;
-  assert(handler_);
+  TESSEL_INVARIANT(handler_ != nullptr);
   std::thread([number = signalNumber_, queue = std::exchange(queue_, nullptr),
                handler = std::exchange(handler_, nullptr)] {
     deliverForEver(number, queue, handler);
   }).detach();
 }
 
-// One unit of a counter of the runtime's.
+// One unit of one of the runtime's two counters, for as long as it lives.
 class ServiceRuntime::Hold final : public KeepAliveTransaction {
  public:
   Hold(ServiceRuntime& runtime, size_t& counter) : runtime_(runtime), counter_(counter) {
@@ -142,6 +152,8 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
   Hold& operator=(const Hold&) = delete;
   ~Hold() override {
     const std::lock_guard lock(runtime_.mutex_);
+    // Below zero the process would never end, or end in the middle of a run.
+    TESSEL_INVARIANT(counter_ > 0);
     --counter_;
     runtime_.changed_.notify_all();
   }
@@ -154,7 +166,7 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
 ServiceRuntime::ServiceRuntime(ServiceManager& manager) : manager_(manager) {}
 
 std::unique_ptr<KeepAliveTransaction> ServiceRuntime::openTransaction(const std::string& /*name*/) {
-  // Work starts with most of a watchdog period before it.
+  // From here on the work itself must send the signs of life. This one gives it a fresh period.
   manager_.progress();
   return std::make_unique<Hold>(*this, transactions_);
 }
@@ -191,7 +203,7 @@ void ServiceRuntime::waitUntilExitAllowed() {
     return;
   }
   while (!changed_.wait_for(lock, feedInterval, [this] { return exitAllowed(); })) {
-    if (transactions_ > 0) continue;
+    if (transactions_ > 0) continue;  // its work sends the signs of life
     lock.unlock();
     manager_.progress();
     lock.lock();

@@ -1,4 +1,4 @@
-// The process: its setup, its signals, its word with the service manager, and how long it lives.
+// The process: its setup, its signals, its messages to the service manager, and how long it lives.
 
 #pragma once
 
@@ -14,43 +14,40 @@
 
 namespace tessel {
 
-// What the process owes its platform before anything else runs.
-
-// Call first in main(), before any thread exists:
-//  - blocks SIGINT, in this thread and in every later one, so that an interrupt waits for its
-//    signal source instead of ending the process by the signal;
-//  - ignores SIGPIPE: a reader of the log that went away is no reason to end;
-//  - opens /dev/null for each standard descriptor that is closed, so that no file that is opened
-//    later takes its number and receives log lines;
-//  - has the heap give large blocks back, so that a process that stays does not hold between two
-//    runs what the last one took.
+// Prepares the process. Call it first in main(), before any thread exists. It
+//  - blocks SIGINT in this thread and in all later ones, so that an interrupt waits for its signal
+//    source and does not kill the process;
+//  - ignores SIGPIPE, because a log reader that went away is no reason to end;
+//  - opens /dev/null for each standard descriptor that is closed, or a file that is opened later
+//  would
+//    get that number and receive log lines;
+//  - makes the heap give large blocks back, so that an idle process does not keep the memory of its
+//    last run.
 void prepareProcess();
 
 // Blocks `signalNumber` in the calling thread and in those that it starts.
 void blockSignal(int signalNumber);
 
-// ServiceManager: readiness, status in words, and the watchdog, told to the service manager.
-//
-// Where no service manager listens every call is cheap and says nothing. Any thread may call. It
-// lives as long as the process.
-
+// Tells the service manager readiness, status in words, and signs of life. If no manager listens,
+// every call is cheap and does nothing. Any thread may call. It lives as long as the process.
 class ServiceManager final : public ServiceStatus {
  public:
   // Sends one message of the notification protocol: NAME=value lines.
   using Notify = std::function<void(const std::string& message)>;
 
-  // `watchdog` is how long the manager waits for a sign of life; zero: it does not.
+  // `watchdog` is how long the manager waits for a sign of life before it kills the process; zero
+  // if it does not watch.
   ServiceManager(Clock& clock, Notify notify, std::chrono::nanoseconds watchdog);
 
   // The process is up.
   void ready();
   // The process is about to end.
   void stopping();
-  // The same words again are not sent again. Counts as progress.
+  // Sends the words unless they are those of the last call. Counts as progress.
   void say(std::string_view words) override;
-  // A sign of life, sent at most four times per watchdog period.
+  // Sends a sign of life, at most four times per watchdog period.
   void progress() override;
-  // How often a process that has nothing to do should call progress(); zero: never.
+  // How often a process that has nothing to do should call progress(). Zero: never.
   std::chrono::nanoseconds feedInterval() const { return feedInterval_; }
 
  private:
@@ -67,20 +64,17 @@ class ServiceManager final : public ServiceStatus {
 // The manager that the environment names ($NOTIFY_SOCKET, $WATCHDOG_USEC). `clock` must outlive it.
 std::unique_ptr<ServiceManager> connectServiceManager(Clock& clock);
 
-// ThreadSignalSource: a signal source with a thread that waits for its signal.
-//
-// The signal must be blocked in every thread, which blockSignal() sees to when it is called before
-// the first one starts: it then stays pending until the source is resumed, and is delivered to the
-// queue and nowhere else. Setting the handler and resuming are for one thread; once resumed, the
-// source delivers for as long as the process lives, also after its last reference was dropped.
-
+// A signal source with a thread that waits for its signal. A signal that arrives before the source
+// is resumed stays pending and is delivered then. The source delivers for as long as the process
+// lives, even after its last reference is dropped. Threads: one sets the handler and resumes.
 class ThreadSignalSource final : public SignalSource {
  public:
-  // REQUIRES: `signalNumber` is blocked in every thread of the process.
+  // REQUIRES: `signalNumber` is blocked in every thread of the process. Call blockSignal() before
+  // the first thread starts.
   ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue);
 
   void setHandler(Closure handler) override;
-  // Starts delivery; a second call does nothing. REQUIRES: a handler is set.
+  // Starts the delivery. A second call does nothing. REQUIRES: a handler is set.
   void resume() override;
 
  private:
@@ -89,12 +83,9 @@ class ThreadSignalSource final : public SignalSource {
   Closure handler_;
 };
 
-// ServiceRuntime: how long the process lives.
-//
-// The process ends with status 0 when a clean exit was requested, no keep-alive transaction is open
-// and no delivery is pending. A request stays in force until then. Any thread may call; the runtime
-// must outlive every transaction, so it lives as long as the process.
-
+// Decides how long the process lives. It ends with status 0 as soon as somebody has requested a
+// clean exit, no keep-alive transaction is open and no delivery is pending. Any thread may call.
+// The runtime outlives every transaction, so it lives as long as the process.
 class ServiceRuntime final : public Runtime {
  public:
   // `manager` must outlive the runtime.
@@ -102,15 +93,16 @@ class ServiceRuntime final : public Runtime {
 
   std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) override;
   void requestCleanExit() override;
-  // A source on a thread of its own; see ThreadSignalSource for what it requires.
+  // Makes a ThreadSignalSource; see there for what it requires.
   std::shared_ptr<SignalSource> makeSignalSource(int signalNumber,
                                                  std::shared_ptr<SerialQueue> queue) override;
   // Tells the manager that the process is ready, waits until it may end, and ends it. While no
-  // transaction is open the loop keeps the watchdog content; while one is, its work has to.
+  // transaction is open, this loop sends the signs of life. While one is open, its work must send
+  // them, or a run that hangs would look alive.
   [[noreturn]] void runMainLoop() override;
 
-  // Keeps the process alive while a delivery is pending, until the result is destroyed. Unlike a
-  // transaction it is no sign of work under way.
+  // Keeps the process alive until the result is destroyed, because a delivery is pending. Unlike a
+  // transaction it does not mean that work is under way.
   std::unique_ptr<KeepAliveTransaction> expectDelivery();
   // Whether the main loop would end the process now.
   bool mayExit() const;

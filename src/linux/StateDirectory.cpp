@@ -1,4 +1,14 @@
-// The state directory on disk, and files by descriptor.
+// The state directory on disk, and the removal of a marker.
+//
+// The run marker is a file, but anybody who may write to its directory can put a directory there,
+// and a marker that cannot be removed would stop all later runs. So a directory is removed with all
+// that is in it. The service may run as root, so the walk must not be led astray:
+//  - It goes from descriptor to descriptor (openat with O_NOFOLLOW), never by path. A link that
+//    somebody puts in the way between two steps is not followed.
+//  - It enters no other mount. A file system that is mounted below the marker, or bound there from
+//    the root, must not be emptied.
+//  - It has a bounded depth, because each level holds a descriptor.
+// std::filesystem::remove_all was discarded: it crosses mounts.
 
 #include "linux/StateDirectory.h"
 
@@ -26,15 +36,16 @@ namespace tessel {
 namespace {
 
 constexpr mode_t kDirectoryMode = 0750;
-constexpr size_t kMaxRecordSize = 64;
+constexpr size_t kMaxRecordSize = 64;  // a decimal 64-bit number and a line feed take 21
 
-// A slash at the end would pass for a name of its own when the directory above is looked for.
+// For a path with a slash at the end, parent_path() would answer the directory itself.
 std::string withoutTrailingSlashes(std::string path) {
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   return path;
 }
 
-// Makes the directory and what is missing above it; the errno of what went wrong, or 0.
+// Makes the directory and those above it that are missing. Answers 0 or the errno of the failure.
+// The directory itself is made apart, because only it has this mode.
 int makeDirectory(const std::string& path) {
   const std::filesystem::path parent = std::filesystem::path(path).parent_path();
   std::error_code error;
@@ -46,7 +57,8 @@ int makeDirectory(const std::string& path) {
   return S_ISDIR(facts.st_mode) ? 0 : ENOTDIR;
 }
 
-// For flock(): the directory itself, which can be locked also where it cannot be written to.
+// Opens the directory for flock(). A lock on the directory itself needs no file in it and no write
+// permission.
 UniqueFd openForLocking(const std::string& directory) {
   return UniqueFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
 }
@@ -76,6 +88,7 @@ std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX
 
 std::optional<Date> StateDirectory::lastRun() const {
   const std::optional<std::string> text = readSmallFile(recordFile(), kMaxRecordSize);
+  // Without its line feed the record is cut short, and its number may be, too.
   if (!text || !text->ends_with('\n')) return {};
   int64_t microseconds = 0;
   const char* end = text->data() + text->size() - 1;
@@ -92,7 +105,8 @@ namespace {
 
 constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
-// Tells mounts apart, a directory that is mounted from the same file system included.
+// Tells mounts apart. The device alone would not do: a bind mount of the same file system has the
+// same.
 using MountKey = std::tuple<uint64_t, uint32_t, uint32_t>;
 
 std::optional<MountKey> mountOf(int directory) {
@@ -106,13 +120,16 @@ struct CloseDirectory {
 };
 using Directory = std::unique_ptr<DIR, CloseDirectory>;
 
-// Removes trees on one mount. Keeps the first error and goes on with the rest.
+// Removes a tree on one mount. It keeps the first error and goes on, so that as little as possible
+// is left.
 class Remover {
  public:
   explicit Remover(MountKey mount) : mount_(mount) {}
 
-  // Removes what `parent` calls `name`; `path` is its name in errors.
+  // Removes `name` in the directory `parent`. `path` names it in errors.
   bool remove(int parent, const char* name, const std::string& path, int depth) {
+    // Try as a file first: looking before would leave a moment in which it may become another
+    // thing.
     if (::unlinkat(parent, name, 0) == 0) return true;
     const int error = errno;
     if (!isDirectory(parent, name)) return failed(path, errorWords(error));
@@ -134,7 +151,7 @@ class Remover {
     if (mountOf(fd.get()) != mount_) return failed(path, "something is mounted here");
     const Directory directory(::fdopendir(fd.get()));
     if (!directory) return failed(path, errorWords(errno));
-    const int inside = fd.release();
+    const int inside = fd.release();  // closedir() closes it
     bool removedAll = true;
     while (const dirent* entry = ::readdir(directory.get())) {
       const std::string_view item = entry->d_name;
@@ -162,6 +179,7 @@ FileExistence LocalFiles::existence(const std::string& path) {
   return {true, S_ISDIR(facts.st_mode)};
 }
 
+// O_EXCL makes it one step with the question whether anything is there, and follows no link.
 bool LocalFiles::createFile(const std::string& path) {
   constexpr int kNewFile = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
   return UniqueFd(::open(path.c_str(), kNewFile, 0666)).valid();

@@ -1,4 +1,7 @@
 // Clocks, os-release, mountinfo and ICU.
+//
+// Every source here may be missing or odd in a container. None of these questions fails: each has
+// an answer for "unknown", and the service then decides on the careful side.
 
 #include "linux/SystemFacts.h"
 
@@ -20,6 +23,8 @@
 namespace tessel {
 
 uint64_t SystemClock::continuousTicks() {
+  // CLOCK_MONOTONIC would stand still while the machine sleeps, and a run would then come a night
+  // late.
   timespec time{};
   clock_gettime(CLOCK_BOOTTIME, &time);
   return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000 + static_cast<uint64_t>(time.tv_nsec);
@@ -39,7 +44,7 @@ bool SystemClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
 
 namespace {
 
-constexpr size_t kMaxOsReleaseSize = size_t{64} << 10;
+constexpr size_t kMaxOsReleaseSize = size_t{64} << 10;  // usual ones have half a kilobyte
 
 std::string_view withoutQuotes(std::string_view value) {
   const bool quoted =
@@ -74,7 +79,7 @@ namespace {
 
 bool isOctal(char digit) { return digit >= '0' && digit <= '7'; }
 
-// The kernel writes blanks and backslashes in a field as \ooo.
+// The kernel writes a blank or a backslash in a field as \ooo, so that blanks separate fields.
 std::string unescaped(std::string_view field) {
   std::string out;
   for (size_t i = 0; i < field.size(); ++i) {
@@ -90,8 +95,9 @@ std::string unescaped(std::string_view field) {
   return out;
 }
 
-// The type of the file system in one line, where that is mounted at "/". A line reads
+// The file system type in one line, if that line is about "/". A line reads
 //   id parent device root MOUNT-POINT options [optional...] - TYPE source options
+// The number of optional fields varies, so the type is looked for behind the dash.
 std::optional<std::string> typeAtRoot(const std::string& line) {
   std::istringstream fields(line);
   std::string field;
@@ -130,7 +136,7 @@ std::unique_ptr<icu::TimeZone> makeTimeZone(const std::optional<std::string>& na
       icu::TimeZone::createTimeZone(icu::UnicodeString::fromUTF8(*name)));
 }
 
-// ICU must not be given a locale whose name it cannot read; that one counts as none.
+// A locale whose name ICU cannot read makes it fail later. Such a name counts as "C".
 icu::Locale makeLocale(const std::string& name) {
   const icu::Locale locale = icu::Locale::createCanonical(name.c_str());
   return locale.isBogus() ? icu::Locale::createCanonical("C") : locale;
@@ -148,7 +154,7 @@ std::string IcuDates::format(Date date) {
       std::chrono::floor<std::chrono::milliseconds>(date).time_since_epoch().count();
   const std::unique_ptr<icu::DateFormat> formatter(icu::DateFormat::createDateTimeInstance(
       icu::DateFormat::kShort, icu::DateFormat::kMedium, makeLocale(locale_)));
-  // ICU without its data can make no format; the log then shows the plain number.
+  // ICU without its data cannot make a format. The log then shows the number of seconds.
   if (!formatter) return std::to_string(milliseconds / 1000);
   if (auto zone = makeTimeZone(timeZone_)) formatter->adoptTimeZone(zone.release());
   icu::UnicodeString text;

@@ -1,4 +1,4 @@
-// What this machine says of itself: its clocks, its build variant, its root volume, its dates.
+// What this machine says about itself: its clocks, build variant, root volume and dates.
 
 #pragma once
 
@@ -9,11 +9,10 @@
 
 namespace tessel {
 
-// SystemClock: the machine's clocks. Stateless; any thread.
-
+// The machine's clocks. Stateless; any thread.
 class SystemClock final : public Clock {
  public:
-  // Nanoseconds since boot, time asleep included.
+  // Nanoseconds since boot, including the time asleep.
   uint64_t continuousTicks() override;
   Timebase timebase() override { return {1, 1}; }
   Date now() override;
@@ -25,15 +24,12 @@ class SystemClock final : public Clock {
 // the last counts, as for a shell that reads the file. Empty if there is none. Points into `text`.
 std::string_view osReleaseValue(std::string_view text, std::string_view name);
 
-// OsReleaseBuildVariant: the build variant by the operating system's own description of itself.
-//
-// The file is read once, by the constructor; questions are answered from memory. Immutable; any
-// thread may ask.
-
+// The build variant as the os-release file tells it. The constructor reads the file once.
+// Immutable; any thread may ask.
 class OsReleaseBuildVariant final : public BuildVariant {
  public:
-  // `path` names a file in the os-release format. Internal where its VARIANT_ID is "internal"; not
-  // where the file cannot be read or does not say.
+  // `path` names a file in the os-release format. The build is internal if VARIANT_ID is
+  // "internal", and not if the file cannot be read or has no such line.
   explicit OsReleaseBuildVariant(const std::string& path);
 
   // The same for every subsystem.
@@ -43,28 +39,26 @@ class OsReleaseBuildVariant final : public BuildVariant {
   const bool internal_;
 };
 
-// MountTable: facts of the mount table. Read anew for every question; any thread.
-
+// The mount table. Read anew for every question; any thread.
 class MountTable final : public Volumes {
  public:
   // `path` names a file in the kernel's mountinfo format.
   explicit MountTable(std::string path = "/proc/self/mountinfo") : path_(std::move(path)) {}
 
-  // Of several mounts at "/" the topmost counts: the last in the table.
+  // Of several mounts at "/" the topmost counts, which is the last in the table.
   std::optional<std::string> rootFilesystemTypeName() override;
 
  private:
   const std::string path_;
 };
 
-// IcuDates: dates as people of this machine's locale and time zone write them. Any thread.
-
+// Dates in this machine's locale and time zone. Immutable; any thread.
 class IcuDates final : public DateFormatter {
  public:
-  // The locale of the environment for dates ($LC_ALL, $LC_TIME, $LANG) and the machine's time zone
-  // at the moment of formatting.
+  // The locale that the environment names for dates ($LC_ALL, $LC_TIME, $LANG), and the machine's
+  // time zone at the moment of formatting.
   IcuDates();
-  // A locale ("de_DE.UTF-8") and a time zone ("Europe/Berlin") of the caller's choice.
+  // A locale such as "de_DE.UTF-8" and a time zone such as "Europe/Berlin".
   IcuDates(std::string locale, std::optional<std::string> timeZone);
 
   std::string format(Date date) override;
