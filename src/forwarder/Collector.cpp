@@ -1,4 +1,8 @@
 // One request with libcurl.
+//
+// One handle serves all requests, because it keeps the connection: a TLS handshake costs more than
+// a batch. Redirects are not followed, as a redirected request would take events and credentials to
+// a host that nobody configured.
 
 #include "forwarder/Collector.h"
 
@@ -11,17 +15,19 @@ namespace tessel {
 
 namespace {
 
-// Beyond this an answer is cut off.
+// An answer is cut off here. Up to here it is read and thrown away, so that the connection can be
+// used again after a long one.
 constexpr size_t kMostRead = size_t{16} << 20;
-// Fastest level: it takes a body of records to a tenth, and slower ones not to much less.
+// The fastest level makes a body of records a tenth as long. Slower ones gain little more.
 constexpr int kCompressionLevel = 1;
-constexpr int kGzipWindow = 15 + 16;
+constexpr int kGzipWindow = 15 + 16;  // zlib: the largest window, and 16 asks for a gzip header
 
 struct Reading {
   std::string body;
   size_t received = 0;
 };
 
+// Answering less than `count` makes libcurl end the transfer.
 size_t takeBody(char* bytes, size_t /*one*/, size_t count, void* target) {
   auto& reading = *static_cast<Reading*>(target);
   reading.received += count;
@@ -29,11 +35,13 @@ size_t takeBody(char* bytes, size_t /*one*/, size_t count, void* target) {
   return reading.received > kMostRead ? 0 : count;
 }
 
+// libcurl calls this about once a second while it waits, and ends the request if the answer is not
+// 0.
 int checkCancelled(void* flag, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
   return static_cast<const std::atomic<bool>*>(flag)->load() ? 1 : 0;
 }
 
-// A gzip stream that is used for one body after another.
+// A gzip stream for one body after another, because its state of 256 KiB is costly to set up.
 class Gzip {
  public:
   Gzip() {
@@ -47,7 +55,7 @@ class Gzip {
   bool compress(std::string_view text, std::string& out) {
     if (!good_ || deflateReset(&stream_) != Z_OK) return false;
     out.resize(deflateBound(&stream_, text.size()));
-    // zlib does not write to its input.
+    // zlib's interface has no const here, but it does not write to its input.
     stream_.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
     stream_.avail_in = static_cast<uInt>(text.size());
     stream_.next_out = reinterpret_cast<Bytef*>(out.data());
@@ -88,6 +96,7 @@ struct CurlCollector::Handles {
   }
   void setHeaders(const ForwarderSettings& settings, std::string_view contentType) {
     headers = curl_slist_append(headers, ("Content-Type: " + std::string(contentType)).c_str());
+    // Without this, libcurl would ask before each large body whether it may send it, and wait.
     headers = curl_slist_append(headers, "Expect:");
     if (settings.compress) headers = curl_slist_append(headers, "Content-Encoding: gzip");
     for (const std::string& header : settings.headers)
@@ -103,6 +112,7 @@ CurlCollector::CurlCollector(const ForwarderSettings& settings, std::string_view
   to.set(CURLOPT_PROTOCOLS_STR, "http,https");
   to.set(CURLOPT_FOLLOWLOCATION, 0L);
   to.set(CURLOPT_TIMEOUT_MS, static_cast<long>(settings.timeout.count()));
+  // Signals belong to the signal thread; libcurl would use SIGALRM for its timeout.
   to.set(CURLOPT_NOSIGNAL, 1L);
   to.set(CURLOPT_USERAGENT, "statora_forwarder/" TESSEL_VERSION);
   to.set(CURLOPT_POST, 1L);
@@ -137,6 +147,7 @@ CollectorAnswer CurlCollector::post(std::string_view body) {
   CollectorAnswer answer;
   answer.bytesSent = sent.size();
   answer.body = std::move(reading.body);
+  // The status of an answer that was cut off had arrived, and it is what matters.
   const bool cutOff = result == CURLE_WRITE_ERROR && reading.received > kMostRead;
   if (result != CURLE_OK && !cutOff) {
     answer.error = with.reason[0] != '\0' ? with.reason : curl_easy_strerror(result);

@@ -1,4 +1,4 @@
-// Where records go: the role Collector, and CurlCollector, which reaches one with HTTP.
+// Where records go: the role Collector, and CurlCollector, which reaches a collector with HTTP.
 
 #pragma once
 
@@ -15,14 +15,12 @@
 
 namespace tessel {
 
-// Collector: where records go, and what it answered.
-
 struct CollectorAnswer {
-  long status = 0;                                 // of HTTP; 0 where none arrived
-  std::string body;                                // its beginning, kMaxAnswerBytes at most
+  long status = 0;                                 // of HTTP; 0 if no answer arrived
+  std::string body;                                // its beginning, at most kMaxAnswerBytes
   std::string error;                               // why no answer arrived, in words
-  std::optional<std::chrono::seconds> retryAfter;  // what the collector asked for; never negative
-  size_t bytesSent = 0;                            // of the request's body, as sent
+  std::optional<std::chrono::seconds> retryAfter;  // the wait that the collector asks for, positive
+  size_t bytesSent = 0;                            // of the request's body, after compression
 };
 
 class Collector {
@@ -30,18 +28,15 @@ class Collector {
   static constexpr size_t kMaxAnswerBytes = size_t{64} << 10;
 
   virtual ~Collector() = default;
-  // Sends one request and waits for its answer, as long as the settings allow.
+  // Sends one request and waits for its answer for as long as the settings allow.
   virtual CollectorAnswer post(std::string_view body) = 0;
 };
 
-// CurlCollector: a collector that is reached with HTTP, one connection kept open.
+// A collector that is reached with HTTP over a connection that stays open. The server's certificate
+// is verified and redirects are not followed. An answer is kept up to kMaxAnswerBytes and read up
+// to a bound far above; one that goes on is cut off, and its status counts.
 //
-// The server's certificate is verified, redirects are not followed, and an answer is read for as
-// long as the timeout allows but kept only up to kMaxAnswerBytes; one that goes on far beyond that
-// is cut off, and its status counts.
-//
-// Threads: one at a time, but for cancel(). REQUIRES: curl_global_init() was called.
-
+// Threads: one at a time, except for cancel(). REQUIRES: curl_global_init() was called.
 class CurlCollector final : public Collector {
  public:
   CurlCollector(const ForwarderSettings& settings, std::string_view contentType);
@@ -50,7 +45,7 @@ class CurlCollector final : public Collector {
   ~CurlCollector() override;
 
   CollectorAnswer post(std::string_view body) override;
-  // Ends the request under way and every later one without an answer. Any thread.
+  // Ends the present request and every later one without an answer. Any thread.
   void cancel() { cancelled_ = true; }
 
  private:

@@ -10,6 +10,7 @@
 
 #include "linux/SystemFacts.h"
 #include "os/Files.h"
+#include "platform/Invariant.h"
 
 namespace tessel {
 
@@ -22,6 +23,8 @@ constexpr const OutputFormat* kFormats[] = {&kOtlpJson};
 
 constexpr size_t kMaxOsReleaseBytes = size_t{64} << 10;
 
+// OpenTelemetry's names for processor architectures differ from the kernel's. A name that is not in
+// the table goes out as the kernel writes it.
 std::string architectureName() {
   constexpr std::pair<std::string_view, const char*> kNames[] = {
       {"x86_64", "amd64"},  {"aarch64", "arm64"}, {"i686", "x86"},
@@ -77,6 +80,8 @@ Batch cutBatch(std::vector<SpooledEvent> events, const Encoder& encoder, std::st
       batch.malformed.push_back(std::move(event));
     }
   }
+  // A batch without a row would make the forwarder ask for the same rows for ever.
+  TESSEL_INVARIANT(!batch.records.empty() || !batch.malformed.empty());
   return batch;
 }
 

@@ -1,16 +1,27 @@
 // Delivering batch after batch.
+//
+// A collector refuses a batch as a whole and does not say which record is at fault. Halving finds
+// it: one bad record among 512 costs about 20 requests, and the good ones still arrive in order. To
+// send each record alone after a refusal was discarded, as it costs 512.
+//
+// The danger is a collector that refuses everything by its own fault. Halving would then set the
+// whole spool aside. Hence the limit on refusals in a row: at most that many records move, and then
+// all wait.
 
 #include "forwarder/Forwarder.h"
 
 #include <algorithm>
 #include <utility>
 
+#include "platform/Invariant.h"
+
 namespace tessel {
 
 namespace {
 
-// Free space is given back in steps that are over before the service would notice, with room for
-// its sends between them, and no more of them at a time than new events can wait for.
+// Free space is given back in small steps, because each holds the lock for which a send of the
+// service may wait. The breaks let such a send through. The number of steps is bounded, because new
+// events wait for the end of the last one.
 constexpr int kPagesGivenBackAtOnce = 64;
 constexpr int kStepsAtOnce = 50;
 constexpr std::chrono::milliseconds kBetweenSteps{20};
@@ -42,6 +53,7 @@ ForwarderOutcome Forwarder::deliverAll() {
     }
     sayProgress();
   }
+  // Everything is delivered, so the collector waits for nothing while the file gets shorter.
   for (int step = 0; step < kStepsAtOnce; ++step) {
     if (!world_.state.shrink(kPagesGivenBackAtOnce) || !takeBreak(kBetweenSteps)) break;
   }
@@ -49,6 +61,8 @@ ForwarderOutcome Forwarder::deliverAll() {
 }
 
 ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
+  const uint64_t settledBefore = settled();
+  // Rows that cannot become records go first: they must not wait for a collector.
   for (const SpooledEvent& event : batch.malformed) {
     if (!setAside(event, 0, "the payload is not a flat JSON object")) return outcome_;
   }
@@ -63,15 +77,25 @@ ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
       case Sent::failed:
         return outcome_;
       case Sent::refused:
+        // The first half goes on top, so that the records keep their order.
         parts.push_back(part.subspan(part.size() / 2));
         parts.push_back(part.first(part.size() / 2));
         break;
     }
   }
+  // However the batch was split, each of its rows was delivered or set aside, and none twice.
+  TESSEL_INVARIANT(settled() - settledBefore == batch.records.size() + batch.malformed.size());
   return ForwarderOutcome::delivered;
 }
 
+// The rows that have left the spool so far.
+uint64_t Forwarder::settled() const {
+  const ForwarderCounters& counters = world_.state.counters();
+  return counters.delivered + counters.setAside;
+}
+
 Forwarder::Sent Forwarder::send(Records part) {
+  // Encoded once: every attempt sends the same bytes.
   const std::string body = world_.encoder.body(part);
   for (uint32_t failures = 1;; ++failures) {
     if (!takeBreak(pace_.waitAt(ticks()))) return fail(ForwarderOutcome::stopped, "asked to stop");
@@ -91,6 +115,7 @@ Forwarder::Sent Forwarder::send(Records part) {
 
 bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
   const std::string words = answerWords(answer);
+  // Said once per batch in the log; the status shows the present state.
   if (failures == 1) kForwarderLog.error("The collector takes nothing for now: %@", words);
   world_.status.say("Waiting for the collector: " + words);
   ++world_.state.counters().retries;
@@ -106,6 +131,7 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
     return fail(ForwarderOutcome::held, "record after record is refused: " + answerWords(answer));
   }
   refusals_ = 0;
+  // A partial success is final: the collector has taken the batch and would take the others twice.
   const PartialSuccess partial = world_.encoder.partialSuccess(answer.body);
   if (partial.rejected > 0) {
     world_.state.counters().rejected += partial.rejected;
@@ -128,10 +154,10 @@ bool Forwarder::setAside(const SpooledEvent& event, int64_t status, const std::s
   return true;
 }
 
-// Waits; false where it is to stop.
+// Waits. False if somebody asked to stop.
 bool Forwarder::takeBreak(std::chrono::nanoseconds time) {
   if (!world_.clock.wait(world_.stop, time)) return true;
-  // Whoever else waits is to stop, too.
+  // The wait has taken the signal, and the next one must see it as well.
   world_.stop.signal();
   return false;
 }

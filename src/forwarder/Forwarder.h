@@ -1,12 +1,15 @@
 // Forwarder: moves events from the spool to a collector, oldest first, each at least once.
 //
-// A batch that the collector takes is acknowledged in the spool. One that cannot be delivered now
-// is tried again after a while, for ever or for a few times. One that is refused is split until the
-// record at fault stands alone; that one is set aside with the collector's words, and the others go
-// on. An answer that speaks of address or credentials holds everything up, and sets nothing aside;
-// so does a row of records that are each refused, with none taken in between.
+//  - A batch that the collector takes is acknowledged in the spool.
+//  - A batch that it cannot take now is sent again after a while, for ever or a few times.
+//  - A batch that it refuses is split until the record at fault stands alone. That record is set
+//  aside
+//    with the collector's words, and the others go on.
+//  - An answer about the address or the credentials holds everything up and sets nothing aside. So
+//  do
+//    many refused records in a row with none taken between them.
 //
-// Threads: one at a time. Waiting ends early when the stop semaphore is signalled.
+// Threads: one at a time. Signalling the stop semaphore ends every wait early.
 
 #pragma once
 
@@ -30,26 +33,26 @@ inline constexpr LogHandle kForwarderLog("com.vantor.TesselSupport", "statora_fo
 
 struct ForwarderOptions {
   size_t maxRecords = 512;            // in a batch
-  size_t maxBytes = size_t{1} << 20;  // of a batch's body, unless one record alone has more
-  uint32_t maxAttempts = 0;           // at one batch before giving up; 0: for ever
+  size_t maxBytes = size_t{1} << 20;  // of a batch's records, unless one record alone has more
+  uint32_t maxAttempts = 0;           // to send one batch; 0: no limit
   std::chrono::milliseconds firstRetry{5000};
   std::chrono::milliseconds longestRetry{300'000};
-  uint32_t refusalsInARow = 16;     // records set aside until it is taken for no fault of theirs
+  uint32_t refusalsInARow = 16;     // after so many the fault is taken to be the collector's
   uint64_t recordsPerSecond = 100;  // 0: no limit
 };
 
-// How an attempt at everything that waits ended.
+// How an attempt to deliver everything ended.
 enum class ForwarderOutcome {
   delivered,    // nothing waits any more
-  stopped,      // asked to
+  stopped,      // somebody asked it to stop
   unreachable,  // gave up for now
-  held,         // the collector takes nothing, and waiting a little would not help
+  held,         // the collector takes nothing, and a short wait would not help
   spoolFailed,  // the spool cannot be read or changed
 };
 
 class Forwarder {
  public:
-  // The outside that it works with; everything outlives it. `chance` draws from [0, 1).
+  // What it works with. All of it outlives the forwarder. `chance` draws from [0, 1).
   struct World {
     ForwarderState& state;
     const Encoder& encoder;
@@ -72,13 +75,14 @@ class Forwarder {
   enum class Sent { accepted, refused, failed };
 
   ForwarderOutcome deliverBatch(const Batch& batch);
-  // For `failed`, `outcome_` tells how.
+  // If it answers `failed`, `outcome_` and `reason_` say how.
   Sent send(Records part);
   bool waitToRetry(const CollectorAnswer& answer, uint32_t failures);
   Sent settle(Records part, const CollectorAnswer& answer);
   bool setAside(const SpooledEvent& event, int64_t status, const std::string& words);
   bool takeBreak(std::chrono::nanoseconds time);
   Sent fail(ForwarderOutcome outcome, std::string reason);
+  uint64_t settled() const;
   void sayProgress();
   std::chrono::nanoseconds ticks();
 

@@ -27,7 +27,8 @@ namespace {
 
 using Json = nlohmann::json;
 
-// Members that are always floating-point, also where their digits look like an integer's.
+// These members are floating-point numbers, even if their digits look like an integer's: the spool
+// writes 2.0 as 2. A backend that met both kinds under one name would refuse one of them.
 constexpr std::string_view kFloatingKeys[] = {"DurationInSeconds", "FrameRate",
                                               "ProcessingDurationInSeconds"};
 
@@ -44,12 +45,13 @@ void appendStringAttribute(std::string& out, std::string_view key, std::string_v
   out += "}}";
 }
 
-// Appends one attribute for each member of a flat object; stops at anything else.
+// Appends one attribute for each member of a flat object and stops at anything else. It works on
+// the parser's events, because only they carry the digits of a number.
 class AttributeWriter final : public nlohmann::json_sax<Json> {
  public:
   explicit AttributeWriter(std::string& out) : out_(out) {}
 
-  // A number that is not finite: an attribute without a value.
+  // The spool writes null for a number that is not finite. The attribute then has no value.
   bool null() override { return attribute("{}"); }
   bool boolean(bool value) override {
     return attribute(value ? "{\"boolValue\":true}" : "{\"boolValue\":false}");
@@ -101,7 +103,7 @@ class AttributeWriter final : public nlohmann::json_sax<Json> {
   bool inside_ = false;  // the object
 };
 
-// A 64-bit integer is a decimal string in OTLP's JSON, but not everybody writes it so.
+// In OTLP's JSON a 64-bit integer is a decimal string, but some collectors write a number.
 uint64_t integerOf(const nlohmann::json& value) {
   if (value.is_number_unsigned()) return value.get<uint64_t>();
   uint64_t number = 0;

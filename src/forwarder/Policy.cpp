@@ -1,4 +1,8 @@
 // Verdicts, waits and pace.
+//
+// The verdicts follow OTLP's list of statuses that a client may repeat, with one addition: 401,
+// 403, 404, 405, 407 and redirects speak of the way to the collector and not of the records. To
+// take them for refusals would set good records aside after a wrong password.
 
 #include "forwarder/Policy.h"
 
@@ -11,7 +15,9 @@ namespace tessel {
 
 namespace {
 
+// A collector may ask for a longer wait by mistake. After an hour it is asked again.
 constexpr std::chrono::seconds kLongestAsked{3600};
+// Of a collector's words: enough for a sentence, and short in a log line.
 constexpr size_t kMaxWords = 300;
 
 }  // namespace
@@ -47,6 +53,7 @@ std::string answerWords(const CollectorAnswer& answer) {
 
 std::chrono::milliseconds Backoff::wait(uint32_t failures, double chance,
                                         std::optional<std::chrono::seconds> asked) const {
+  // 30 doublings of any wait are over the longest one, and 2^30 is still exact.
   const double doublings = std::min(failures - 1, uint32_t{30});
   const double full = std::min(static_cast<double>(first_.count()) * std::exp2(doublings),
                                static_cast<double>(most_.count()));
@@ -63,6 +70,7 @@ std::chrono::nanoseconds Pace::waitAt(std::chrono::nanoseconds now) const {
 
 void Pace::sent(uint64_t records, std::chrono::nanoseconds now) {
   if (recordsPerSecond_ == 0) return;
+  // A request is paid for after it was sent, so the first one of a day goes out at once.
   next_ = now + std::chrono::nanoseconds{std::chrono::seconds{1}} * records / recordsPerSecond_;
 }
 

@@ -1,4 +1,4 @@
-// What an answer means, when to try again, how fast to go: plain arithmetic without clock or
+// What an answer means, when to try again, and how fast to send. Plain arithmetic without clock or
 // thread.
 
 #pragma once
@@ -14,27 +14,28 @@ namespace tessel {
 
 enum class Verdict {
   accepted,  // any 2xx
-  later,     // the same again after a while: 429, 502, 503, 504, no answer
-  hold,      // no record is at fault, but address or credentials: 3xx, 401, 403, 404, 405, 407
-  refused,   // at least one of the records is at fault: anything else
+  later,     // send the same again after a while: 429, 502, 503, 504, no answer
+  hold,      // the address or the credentials are at fault: 3xx, 401, 403, 404, 405, 407
+  refused,   // at least one record is at fault: anything else
 };
 
 Verdict verdictOn(const CollectorAnswer& answer);
 
-// Status and the beginning of the body, or the error, in one line that is fit for a terminal.
+// The status and the beginning of the body, or the error. One line that is fit for a terminal.
 std::string answerWords(const CollectorAnswer& answer);
 
 // How long to wait before one more attempt.
 class Backoff {
  public:
-  // `first` is the wait after the first failure, at most; each further one doubles it up to `most`.
+  // `first` is the longest wait after the first failure. Each further failure doubles it up to
+  // `most`.
   Backoff(std::chrono::milliseconds first, std::chrono::milliseconds most)
       : first_(first), most_(most) {}
 
-  // The wait after the `failures`-th failure in a row, counted from 1. `chance` is drawn anew from
-  // [0, 1): half the wait is certain and half is chance, so that a fleet that failed together does
-  // not come back together. Where the collector asked for a wait, that counts instead, up to an
-  // hour, and chance comes on top: the whole fleet was asked for the same.
+  // The wait after the `failures`-th failure in a row, counted from 1. `chance` is drawn from [0,
+  // 1) for each wait. Half of the wait is certain and half is chance, so that a fleet that failed
+  // together does not come back together. If the collector asked for a wait, that one counts, up to
+  // an hour, and chance is added to it, because it asked the whole fleet for the same.
   std::chrono::milliseconds wait(uint32_t failures, double chance,
                                  std::optional<std::chrono::seconds> asked) const;
 
@@ -43,7 +44,7 @@ class Backoff {
   const std::chrono::milliseconds most_;
 };
 
-// Keeps to a number of records a second.
+// Keeps to a number of records per second.
 class Pace {
  public:
   // Zero: no limit.

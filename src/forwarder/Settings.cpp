@@ -1,4 +1,7 @@
 // Reading the forwarder's variables.
+//
+// OpenTelemetry's names are used where it has one, because whoever runs a collector knows them.
+// Secrets may come as files, because every process of the user can read an environment.
 
 #include "forwarder/Settings.h"
 
@@ -20,7 +23,7 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxCredentialBytes = size_t{64} << 10;
+constexpr size_t kMaxCredentialBytes = size_t{64} << 10;  // more headers no server would take
 
 using Headers = std::vector<std::string>;
 
@@ -29,12 +32,12 @@ struct Variable {
   std::string value;
 };
 
-// Reads variables and remembers the first that makes no sense.
+// Reads variables and keeps the first error.
 class Variables {
  public:
   explicit Variables(const EnvironmentReader& environment) : environment_(environment) {}
 
-  // A variable that is set to nothing counts as one that is not set.
+  // OpenTelemetry has it that an empty variable counts as one that is not set.
   std::optional<std::string> value(const std::string& name) const {
     std::optional<std::string> text = environment_(name);
     if (text && text->empty()) text.reset();
@@ -53,7 +56,7 @@ class Variables {
   void complain(const std::string& name, const std::string& text, const std::string& expected) {
     if (!error_) error_ = LaunchError{name, text, expected};
   }
-  // A whole number from `least` on.
+  // A whole number, at least `least`.
   std::optional<int64_t> number(const std::string& name, int64_t least) {
     const auto text = value(name);
     if (!text) return {};
@@ -78,7 +81,8 @@ class Variables {
   std::optional<LaunchError> error_;
 };
 
-// `text` with %XX decoded; nothing where that yields what a header cannot hold.
+// `text` with %XX decoded. Absent if the result holds a control character: a line feed would let a
+// value add headers of its own.
 std::optional<std::string> headerText(std::string_view text) {
   std::string out;
   for (size_t at = 0; at < text.size(); ++at) {
@@ -99,7 +103,7 @@ std::optional<std::string> headerText(std::string_view text) {
   return out;
 }
 
-// name=value,name=value, percent-encoded.
+// Reads name=value,name=value, percent-encoded. Absent if the text has another form.
 std::optional<Headers> parseHeaders(std::string_view text) {
   Headers headers;
   while (!text.empty()) {
@@ -132,7 +136,8 @@ bool isLoopback(const std::string& host) {
   return inet_pton(AF_INET, host.c_str(), &address) == 1 && (ntohl(address.s_addr) >> 24) == 127;
 }
 
-// Whether `text` is a URL that may be posted to.
+// Whether events may be sent to the URL `text`. Plain http shows them and the credentials to the
+// network, so it needs the operator's word unless it stays on this machine.
 bool acceptable(const std::string& text, bool allowHttp) {
   const CurlUrl url(curl_url(), &curl_url_cleanup);
   if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return false;
@@ -172,6 +177,7 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   }
 }
 
+// The error names the source of the headers and never shows them.
 void addHeaders(Variables& variables, ForwarderSettings& settings, const std::string& source,
                 std::string_view text) {
   const auto headers = parseHeaders(text);

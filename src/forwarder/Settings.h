@@ -1,11 +1,12 @@
-// ForwarderSettings: what the environment says about the forwarder, read once at its start.
+// ForwarderSettings: what the environment says about the forwarder. It is read once, at the start.
 //
-// Where to and how follows OpenTelemetry's variables, OTEL_EXPORTER_OTLP_<NAME>, of which
-// OTEL_EXPORTER_OTLP_LOGS_<NAME> comes first: ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE,
-// CLIENT_CERTIFICATE, CLIENT_KEY, PROTOCOL (an output format). Secrets are files in
+// The collector is set by OpenTelemetry's variables OTEL_EXPORTER_OTLP_<NAME>, where <NAME> is
+// ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE, CLIENT_CERTIFICATE, CLIENT_KEY or PROTOCOL
+// (the output format). OTEL_EXPORTER_OTLP_LOGS_<NAME> wins over it. Secrets are files in
 // $CREDENTIALS_DIRECTORY: otlp-headers, otlp-certificate, otlp-client-certificate, otlp-client-key.
 //
-//   TESSEL_FORWARD_RATE        records a second; 0: no limit                        100
+//                                                                                 default
+//   TESSEL_FORWARD_RATE        records per second; 0: no limit                      100
 //   TESSEL_FORWARD_SPREAD      seconds over which a start is spread                 300
 //   TESSEL_FORWARD_INTERVAL    seconds between looks for new events                 30
 //   TESSEL_FORWARD_RETRY       seconds until the first new attempt, at most         5
@@ -32,7 +33,7 @@ struct ForwarderSettings {
   std::vector<std::string> headers;  // each "name: value"
   std::chrono::milliseconds timeout{10'000};
   bool compress = false;
-  // Paths; empty: the system's authorities, no client certificate.
+  // Paths. Empty ones mean the system's authorities and no client certificate.
   std::string authorities, clientCertificate, clientKey;
   uint64_t recordsPerSecond = 100;
   std::chrono::seconds spread{300};
@@ -41,8 +42,8 @@ struct ForwarderSettings {
   bool sendInstanceId = false;
 };
 
-// The first variable that makes no sense is the error; that there is no endpoint is one. Headers
-// are never quoted in it.
+// The error is the first variable that makes no sense. A missing endpoint is an error, too. It
+// never quotes headers, which hold secrets.
 std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     const EnvironmentReader& environment);
 // The output format alone, which needs no endpoint.
