@@ -7,8 +7,9 @@
 // spool's identifier and the row's id, so that a backend can tell a record that arrives twice from
 // a new one.
 //
-// The JSON is written by hand, because a document tree would cost several allocations per attribute
-// and would print numbers anew: 0.1f must not come out as 0.10000000149.
+// A record goes from the parser's events straight to the writer. A document tree between them was
+// discarded: it costs several allocations per attribute and prints numbers anew, so that the
+// spool's digits would be lost.
 
 #include "forwarder/Encoder.h"
 
@@ -37,36 +38,40 @@ bool isFloatingKey(std::string_view key) {
          std::end(kFloatingKeys);
 }
 
-void appendStringAttribute(std::string& out, std::string_view key, std::string_view value) {
-  out += "{\"key\":";
-  appendJsonString(out, key);
-  out += ",\"value\":{\"stringValue\":";
-  appendJsonString(out, value);
-  out += "}}";
+// One attribute, of the kind "stringValue", "intValue", "boolValue" or "doubleValue".
+void writeAttribute(JsonWriter& json, std::string_view key, auto&& writeValue) {
+  json.object([&] {
+    json.member("key", key);
+    json.object("value", writeValue);
+  });
 }
 
-// Appends one attribute for each member of a flat object and stops at anything else. It works on
-// the parser's events, because only they carry the digits of a number.
+void writeText(JsonWriter& json, std::string_view key, std::string_view text) {
+  writeAttribute(json, key, [&] { json.member("stringValue", text); });
+}
+
+// Writes one attribute for each member of a flat object and stops at anything else. It works on the
+// parser's events, because only they carry the digits of a number.
 class AttributeWriter final : public nlohmann::json_sax<Json> {
  public:
-  explicit AttributeWriter(std::string& out) : out_(out) {}
+  explicit AttributeWriter(JsonWriter& json) : json_(json) {}
 
   // The spool writes null for a number that is not finite. The attribute then has no value.
-  bool null() override { return attribute("{}"); }
+  bool null() override {
+    return attribute([] {});
+  }
   bool boolean(bool value) override {
-    return attribute(value ? "{\"boolValue\":true}" : "{\"boolValue\":false}");
+    return attribute([&] { json_.member("boolValue", value); });
   }
   bool number_integer(int64_t value) override { return integer(std::to_string(value), true); }
   bool number_unsigned(uint64_t value) override {
     return integer(std::to_string(value), value <= uint64_t{std::numeric_limits<int64_t>::max()});
   }
   bool number_float(double /*value*/, const std::string& digits) override {
-    return floating(digits);
+    return attribute([&] { json_.rawMember("doubleValue", digits); });
   }
   bool string(std::string& value) override {
-    if (!inside_) return false;
-    appendStringAttribute(separated(), key_, value);
-    return true;
+    return attribute([&] { json_.member("stringValue", value); });
   }
   bool binary(Json::binary_t& /*value*/) override { return false; }
   bool start_object(size_t /*size*/) override { return !std::exchange(inside_, true); }
@@ -83,22 +88,16 @@ class AttributeWriter final : public nlohmann::json_sax<Json> {
   }
 
  private:
-  std::string& separated() { return out_ += ','; }
-
-  bool floating(const std::string& digits) { return attribute("{\"doubleValue\":" + digits + '}'); }
   bool integer(const std::string& digits, bool fitsSigned) {
-    if (isFloatingKey(key_)) return floating(digits);
-    return attribute((fitsSigned ? "{\"intValue\":\"" : "{\"stringValue\":\"") + digits + "\"}");
+    if (isFloatingKey(key_)) return number_float(0, digits);
+    return attribute([&] { json_.member(fitsSigned ? "intValue" : "stringValue", digits); });
   }
-  bool attribute(std::string_view value) {
-    if (!inside_) return false;
-    separated() += "{\"key\":";
-    appendJsonString(out_, key_);
-    out_.append(",\"value\":").append(value).append("}");
-    return true;
+  bool attribute(auto&& writeValue) {
+    if (inside_) writeAttribute(json_, key_, writeValue);
+    return inside_;
   }
 
-  std::string& out_;
+  JsonWriter& json_;
   std::string key_;
   bool inside_ = false;  // the object
 };
@@ -123,55 +122,64 @@ class OtlpEncoder final : public Encoder {
   PartialSuccess partialSuccess(std::string_view answer) const override;
 
  private:
-  std::string head_;  // of every body, up to its first record
+  std::string resource_;  // the same in every body
 };
 
-OtlpEncoder::OtlpEncoder(const ResourceFacts& facts)
-    : head_("{\"resourceLogs\":[{\"resource\":{\"attributes\":[") {
-  auto add = [this, first = true](std::string_view key, std::string_view value) mutable {
-    if (value.empty()) return;
-    if (!std::exchange(first, false)) head_ += ',';
-    appendStringAttribute(head_, key, value);
+OtlpEncoder::OtlpEncoder(const ResourceFacts& facts) {
+  const std::pair<std::string_view, std::string> attributes[] = {
+      {"service.name", "tessel_reporter"},
+      {"service.version", facts.serviceVersion},
+      {"service.instance.id", facts.instanceId.value_or("")},
+      {"os.type", "linux"},
+      {"os.name", facts.osName},
+      {"os.version", facts.osVersion},
+      {"host.arch", facts.hostArch},
   };
-  add("service.name", "tessel_reporter");
-  add("service.version", facts.serviceVersion);
-  add("service.instance.id", facts.instanceId.value_or(""));
-  add("os.type", "linux");
-  add("os.name", facts.osName);
-  add("os.version", facts.osVersion);
-  add("host.arch", facts.hostArch);
-  head_ +=
-      "]},\"scopeLogs\":[{\"scope\":{\"name\":\"com.vantor.tessel.tessel_reporter\"},"
-      "\"logRecords\":[";
+  JsonWriter json(resource_);
+  json.object([&] {
+    json.array("attributes", attributes, [&](const auto& attribute) {
+      // An unknown fact is left out: an empty text would look like a fact.
+      if (!attribute.second.empty()) writeText(json, attribute.first, attribute.second);
+    });
+  });
 }
 
 std::optional<std::string> OtlpEncoder::record(const SpooledEvent& event,
                                                std::string_view spoolId) const {
   const std::string time = std::to_string(event.time) + "000";
-  std::string out =
-      "{\"timeUnixNano\":\"" + time + "\",\"observedTimeUnixNano\":\"" + time + "\",\"eventName\":";
-  appendJsonString(out, event.name);
-  out += ",\"attributes\":[";
-  appendStringAttribute(out, "log.record.uid",
-                        std::string(spoolId) + '-' + std::to_string(event.id));
-  AttributeWriter writer(out);
-  if (!Json::sax_parse(event.payload, &writer)) return {};
-  out += "]}";
+  std::string out;
+  JsonWriter json(out);
+  bool flat = false;
+  json.object([&] {
+    json.member("timeUnixNano", time).member("observedTimeUnixNano", time);
+    json.member("eventName", event.name);
+    json.array("attributes", [&] {
+      writeText(json, "log.record.uid", std::string(spoolId) + '-' + std::to_string(event.id));
+      AttributeWriter writer(json);
+      flat = Json::sax_parse(event.payload, &writer);
+    });
+  });
+  if (!flat) return {};
   return out;
 }
 
 std::string OtlpEncoder::body(std::span<const OutgoingRecord> records) const {
-  constexpr std::string_view kTail = "]}]}]}";
-  size_t size = head_.size() + kTail.size();
+  // A body has up to a mebibyte, and growing step by step would copy it several times.
+  size_t size = resource_.size() + 256;  // 256: for what stands around the records
   for (const OutgoingRecord& record : records) size += record.text.size() + 1;
   std::string all;
   all.reserve(size);
-  all = head_;
-  for (const OutgoingRecord& record : records) {
-    if (&record != &records.front()) all += ',';
-    all += record.text;
-  }
-  return all += kTail;
+  JsonWriter json(all);
+  const auto scope = [&] {
+    json.object("scope", [&] { json.member("name", "com.vantor.tessel.tessel_reporter"); });
+    json.array("logRecords", records, [&](const OutgoingRecord& r) { json.raw(r.text); });
+  };
+  const auto resource = [&] {
+    json.rawMember("resource", resource_);
+    json.array("scopeLogs", [&] { json.object(scope); });
+  };
+  json.object([&] { json.array("resourceLogs", [&] { json.object(resource); }); });
+  return all;
 }
 
 PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {

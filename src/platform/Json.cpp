@@ -50,6 +50,15 @@ void appendDigits(std::string& out, Value value) {
 
 void appendJsonString(std::string& out, std::string_view text, bool forTerminal) {
   out += '"';
+  // Nearly every text is plain ASCII to its end. To decode each of its characters would be most of
+  // what a record costs.
+  size_t plain = 0;
+  while (plain < text.size() && text[plain] >= 0x20 && text[plain] < 0x7f && text[plain] != '"' &&
+         text[plain] != '\\') {
+    ++plain;
+  }
+  out.append(text, 0, plain);
+  text.remove_prefix(plain);
   appendEscaped(
       out, text,
       [=](const Character& character) {

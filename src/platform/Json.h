@@ -59,7 +59,9 @@ class JsonWriter {
   JsonWriter& object(std::string_view name, Write&& write) {
     return key(name).object(std::forward<Write>(write));
   }
-  // An array; `write(item)` writes the value for each of `items`.
+  // An array, whose values `write()` writes, or `write(item)` for each of `items`.
+  template <typename Write>
+  JsonWriter& array(std::string_view name, Write&& write);
   template <typename Items, typename Write>
   JsonWriter& array(std::string_view name, const Items& items, Write&& write);
 
@@ -126,12 +128,19 @@ JsonWriter& JsonWriter::object(Write&& write) {
   return *this;
 }
 
-template <typename Items, typename Write>
-JsonWriter& JsonWriter::array(std::string_view name, const Items& items, Write&& write) {
+template <typename Write>
+JsonWriter& JsonWriter::array(std::string_view name, Write&& write) {
   key(name).open('[');
-  for (const auto& item : items) write(item);
+  write();
   close(']');
   return *this;
+}
+
+template <typename Items, typename Write>
+JsonWriter& JsonWriter::array(std::string_view name, const Items& items, Write&& write) {
+  return array(name, [&] {
+    for (const auto& item : items) write(item);
+  });
 }
 
 }  // namespace tessel
