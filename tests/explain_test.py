@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""What tesselctl explains, held against the run's own books and against the rules written down twice."""
+"""What `tesselctl explain` says, compared with a run's own counts and with the rules in model.py."""
 import html.parser
 import json
 import os
@@ -186,7 +186,7 @@ class Follow(ExplainTest):
         self.sequence += len(entries)
 
     def shown(self, process, count):
-        """The first `count` lines, and how long they took to come."""
+        """The first `count` lines of --follow, and the seconds until they came."""
         began = time.monotonic()
         while time.monotonic() - began < 20:
             process.tessel_output.seek(0)
@@ -241,7 +241,7 @@ class Follow(ExplainTest):
 
 
 class PageReader(html.parser.HTMLParser):
-    """The tags, the texts and the tables of a page."""
+    """Collects the tags, the texts and the tables of a page."""
 
     def __init__(self, page):
         super().__init__(convert_charrefs=True)

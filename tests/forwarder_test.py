@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""The forwarder against a collector that behaves in every way that collectors do."""
+"""The forwarder against collectors that accept, refuse, stall, answer nonsense or break the connection."""
 import email.utils
 import json
 import os
@@ -160,7 +160,7 @@ class Delivery(ForwarderTest):
 
 class Trouble(ForwarderTest):
     def check_retried(self, first, least_wait, **more):
-        """The answer `first`, then acceptance: the same record again after a while."""
+        """The collector answers `first`, then accepts: the forwarder must send the same record again after a pause."""
         self.add(3)
         with Receiver(lambda request, number: first() if number == 0 else Answer()) as receiver:
             self.assertEqual(self.run_forwarder(receiver, **more).returncode, 0, self.errors)
@@ -174,7 +174,7 @@ class Trouble(ForwarderTest):
     def test_the_wait_that_the_collector_asks_for(self):
         self.check_retried(lambda: Answer(429, headers={"Retry-After": "2"}), 1.9)
         self.setUp()
-        # Whole seconds: the date may be almost one second less away than three.
+        # The date has whole seconds, so it may be up to one second less than three away.
         date = email.utils.formatdate(time.time() + 3, usegmt=True)
         self.check_retried(lambda: Answer(429, headers={"Retry-After": date}), 1.9)
 

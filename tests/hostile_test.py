@@ -1,7 +1,7 @@
 #!/usr/bin/env python3
-"""One local user who writes what harms most: floods, odd bytes, values at every cap.
+"""A local user tries to harm the service: floods, odd bytes, values at every limit.
 
-TESSEL_HOSTILE_POINTS sets the size of the floods.
+TESSEL_HOSTILE_POINTS is the number of trace points in a flood.
 """
 import itertools
 import json
@@ -19,7 +19,7 @@ MEMORY = 64 << 10  # KiB that are not pages of files
 ODD = ["\x1b[31mred\x1b[0m\x1b]0;title\x07", "\r\nerror: forged line\n", "%s%n%@%llu%1000000d", "<b>&lt;\"'`$(reboot)",
        "\u202egnp.exe", "\x00nul", "\x7f\x9b31m\x85", "a" * 4096, "..", "/", "{\"TaskedOn\":true}", "'; DROP TABLE events; --",
        b"\xff\xfe\xc0\xaf\xed\xa0\x80".decode("utf-8", "surrogateescape"), "\ufeff\ufffe\U0010ffff", ""]
-# What a terminal acts on: control characters but tab and line feed, in every encoding of them.
+# A terminal acts on control characters. Tab and line feed are harmless.
 TERMINAL = re.compile("[\x00-\x08\x0b-\x1f\x7f-\x9f]")
 
 
@@ -56,7 +56,7 @@ class Flood(MachineTest):
         self.assertEqual(len(said), 1 if POINTS > delivered else 0)
         if said:
             self.assertIn(f" {POINTS - delivered} objects", said[0])
-        # All pairs are listed in the log, the fullest are sent, and each costs its place in the pacing.
+        # The log lists all pairs; the summary sends the pairs with most objects, and each send waits for its turn.
         self.assertEqual(sum("com.vantor.Flood/Category" in line for line in log), delivered)
         self.assertEqual(len(self.machine.rows()), 5 + 1)
 

@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""Life of the process: launch configuration, check-in, deferral, interrupt, two at a time."""
+"""The life of the process: launch configuration, check-in, deferral, interrupt, two processes at a time."""
 import os
 import random
 import sqlite3
@@ -128,7 +128,7 @@ class Pacing(MachineTest):
         self.assert_clean(self.machine.result(process))
         with sqlite3.connect(os.path.join(self.machine.state, "statora.db")) as database:
             times = [row[0] for row in database.execute("SELECT time FROM events ORDER BY id")]
-        # The sends are queued at a paced moment and run soon after; the start of each ten is what is paced.
+        # The service paces the moment at which it queues ten sends. Each send itself may run a little later.
         span = times[199] - times[9]
         self.assertGreater(span, 125_000 * 18, "19 quanta of ten sends")
 

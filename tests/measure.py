@@ -1,4 +1,4 @@
-"""What one run of the service costs."""
+"""Measures the time, processor time and memory of one run of the service."""
 import os
 import re
 import tempfile
@@ -29,8 +29,8 @@ def anonymous_memory(pid):
 
 
 def run_measured(machine, **extra):
-    """One run of the service, from start to end. Each program in between makes way for the next, so that
-    the process that is started here is the service itself."""
+    """Runs the service once. unshare and sh replace themselves by the next program (exec), so the process
+    that is measured here is the service itself."""
     command = in_namespace_argv(machine.var_tmp, [os.path.join(BIN, "tessel_reporter")])
     peak, ended = [0], threading.Event()
 

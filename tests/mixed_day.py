@@ -1,4 +1,4 @@
-"""A day with a bit of everything, as entries in order of recording."""
+"""A day that holds every kind of entry, in order of recording."""
 import os
 
 from harness import log_event, point
@@ -7,7 +7,7 @@ METAINFO = "<component type='desktop-application'><id>{}</id></component>"
 
 
 def make_bundle(machine, directory, identifier):
-    """A bundle directory with metadata; the path of its executable."""
+    """Makes a bundle directory with metadata; answers the path of its executable."""
     root = os.path.join(machine.root, directory)
     os.makedirs(os.path.join(root, "usr/share/metainfo"))
     with open(os.path.join(root, "usr/share/metainfo/a.metainfo.xml"), "w", encoding="utf-8") as file:

@@ -1,10 +1,10 @@
-"""What a run must yield for a list of recorded entries, worked out without the service's code.
+"""Works out, without the service's code, what a run must yield for a list of recorded entries.
 
 This is a second, plain formulation of the rules: delivery, classification, payloads, log, spool.
 """
 import struct
 
-# Values that may be reported on this platform; the tests use these and others that may not.
+# Known values of this platform, which may be reported. The tests also use unknown ones.
 KNOWN = {"week", "day", "small", "imap", "Root", "2,2,1,0", "generationContext", "modeChange", "NO"}
 # (subsystem, category, name) -> (cap, ratio); None stands for "any".
 DOWNSAMPLING = {
@@ -22,7 +22,7 @@ def float32(value):
 
 
 def shortest(value):
-    """The double that the shortest decimal form of a 32-bit float reads back as."""
+    """The double of the shortest decimal text that still reads as the same 32-bit float."""
     for digits in range(1, 18):
         text = f"{value:.{digits}g}"
         if float32(float(text)) == value:
@@ -88,7 +88,7 @@ def deliver(entries):
 
 
 class Rules:
-    """Classification; its downsampling counters go on for as long as it lives."""
+    """Decides about objects. The downsampling counters count over all runs of one Rules object."""
 
     def __init__(self, internal=False):
         self.internal, self.seen, self.reported = internal, {}, {}
@@ -192,7 +192,7 @@ class Run:
                 for _, label, _, ordered in self.sections() for pair, count in ordered[:5]]
 
     def statistics(self, interrupted=False):
-        """The statistics without the duration, which depends on the machine."""
+        """The statistics without the duration, which differs from machine to machine."""
         kinds = ("AnimationInterval", "Interval", "Event")
         keys = ("Animations", "Intervals", "Events")
         return ([("LogObjectsProcessed", len(self.entries))] +
@@ -210,7 +210,7 @@ class Run:
         return lines
 
     def closing_line(self, seconds, interrupted=""):
-        """A pattern; the dates are left open."""
+        """A pattern of the line that matches any dates."""
         figures = [self.count(kind, reported) for kind in ("Event", "Interval", "AnimationInterval")
                    for reported in (True, False)]
         return ("Done processing {} reported and {} unreported events, {} reported and {} unreported intervals and "

@@ -1,4 +1,4 @@
-"""A collector on loopback that answers as it is told and remembers what it got."""
+"""A collector on the loopback address: gives the answers of a script and keeps the requests."""
 import gzip
 import json
 import socket
@@ -10,7 +10,7 @@ from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 
 
 class Answer:
-    """How one request is answered. `kind`: whole, or cut (the connection breaks in the middle)."""
+    """The answer to one request. `kind` is whole, or cut: then the connection breaks in the middle."""
 
     def __init__(self, status=200, body=b"{}", headers=(), kind="whole", delay=0.0):
         self.status, self.body, self.headers, self.kind, self.delay = status, body, dict(headers), kind, delay

@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""Whole runs over a real journal: every row of the spool and every line of the log."""
+"""Whole runs over a real journal: compares every row of the spool and every line of the log."""
 import re
 import subprocess
 
@@ -39,7 +39,7 @@ class MixedDay(MachineTest):
         self.assertEqual(statistics[1:], expected.statistics())
 
     def object_log(self, expected):
-        """The lines that deciding and sending write, object by object."""
+        """The log lines of deciding and sending, for each object in order."""
         lines, set_built, throttled, found = [], False, False, set()
         for thing, verdict in expected.judged:
             if verdict in (DISABLED, DURATION):

@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""tesselctl as people and scripts meet it: exit statuses, terminals, hostile texts, the spool, the switches."""
+"""tesselctl for people and scripts: exit statuses, terminals, hostile texts, the spool, the switches."""
 import contextlib
 import errno
 import json
@@ -16,7 +16,7 @@ from otlp_receiver import Answer, Receiver
 
 HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "%s%n%llu", "two\nlines", "tab\tand\rreturn",
            "\x7fdelete", "caf\udce9", "\u2028separator"]
-# What no text of the outside may bring to a terminal, line feeds apart.
+# Control characters that no recorded text may bring to a terminal. Line feeds are tested elsewhere.
 OBEYED = re.compile("[\x00-\x09\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028\u2029\u202a-\u202e\u2066-\u2069\udc80-\udcff]")
 COLOUR = re.compile("\x1b\\[[0-9]{1,2}m")
 
@@ -31,7 +31,7 @@ class CtlTest(MachineTest):
         return os.path.join(self.machine.state, "statora.db")
 
     def on_terminal(self, *arguments, columns=80, **extra):
-        """What the command writes to a terminal of so many columns, and its exit status."""
+        """Runs the command on a terminal of this width; answers its output and its exit status."""
         leader, follower = pty.openpty()
         environment = self.machine.environment(**{"TERM": "xterm", **extra})
         script = f"stty cols {columns}; exec " + '"$0" "$@"'

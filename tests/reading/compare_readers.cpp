@@ -1,10 +1,11 @@
 // compare_readers [--ours|--stop-after MILLISECONDS] PATH
 //
-// Reads the journals at PATH, a directory or a file, with our reader, with libsystemd, with
-// `journalctl -o export`, and with ours led by the index of TESSEL_KIND, and compares entry by
-// entry. Prints a line of figures for our reader, one for each file that it says something about,
-// and one for each other reader that saw something else; ends with 1 in that last case. --ours
-// reads with ours alone; --stop-after asks it to stop meanwhile and prints how long that took.
+// PATH is a directory or a journal file. Four readers read it: ours, libsystemd, `journalctl -o
+// export`, and ours when it follows the index of TESSEL_KIND. The entries are compared one by one.
+//
+// Prints the figures of our reader, then a line for each file with a problem, then a line for each
+// reader that differs from ours. The exit status is 1 if one differs. --ours reads with our reader
+// alone. --stop-after stops the reading after that time and prints how long the stop took.
 
 #include <algorithm>
 #include <atomic>
@@ -34,14 +35,14 @@ void printReport(const StoreReport& report) {
   }
 }
 
-// The rest of a stream; its fields are looked at and forgotten.
+// Reads a stream to its end and touches each field.
 std::vector<PlainEntry> readHeaders(EntryStream& stream) {
   std::vector<PlainEntry> entries;
   while (stream.next()) entries.push_back({stream.entry().header, {}});
   return entries;
 }
 
-// Entries that were delivered more than once.
+// How many entries were delivered more than once.
 size_t repeated(const std::vector<PlainEntry>& entries) {
   std::set<std::string> seen;
   for (const PlainEntry& entry : entries) seen.insert(cursorOf(entry.header));
@@ -66,8 +67,8 @@ bool same(std::string_view name, const std::vector<PlainEntry>& ours,
   return false;
 }
 
-// What our reader sees where it is led by an index. What it may leave empty, and does, is counted
-// in `spared` and filled in.
+// Reads with the index of TESSEL_KIND. The reader may then deliver entries without a TESSEL_KIND
+// empty. We count those in `spared` and fill them in from the full reading, so that all compare.
 std::vector<PlainEntry> readLedByKind(const std::string& path, const std::vector<PlainEntry>& all,
                                       size_t& spared) {
   testing::RecordingTokenizer tokenizer({{"TESSEL_KIND"}});

@@ -15,7 +15,7 @@
 
 namespace {
 
-// One field of `text` from `at` on, which moves behind it.
+// Reads the field at `at` and moves `at` behind it.
 std::pair<std::string, std::string> parseField(const std::string& text, size_t& at) {
   const size_t lineEnd = text.find('\n', at);
   if (lineEnd == std::string::npos) throw std::runtime_error("field without line feed");

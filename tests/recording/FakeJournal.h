@@ -1,5 +1,5 @@
-// FakeJournal: stands where the journal's socket would be and takes datagrams apart. It names
-// itself in TESSEL_JOURNAL_SOCKET. One thread at a time.
+// FakeJournal: a socket in the place of the journal's. It parses the datagrams that it receives,
+// and sets TESSEL_JOURNAL_SOCKET to its path. For one thread at a time.
 
 #pragma once
 
@@ -24,9 +24,9 @@ class FakeJournal {
   FakeJournal(const FakeJournal&) = delete;
   FakeJournal& operator=(const FakeJournal&) = delete;
 
-  // What has arrived since the last call.
+  // The entries that arrived since the last call.
   std::vector<JournalEntry> take();
-  // Takes the socket away, as a daemon that ends; and puts up a new one.
+  // stop() removes the socket, as a daemon that ends; start() makes a new one.
   void stop();
   void start();
 

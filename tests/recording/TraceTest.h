@@ -1,4 +1,4 @@
-// The fixture of the header's tests: a journal of the test's own, and the program's sockets to it.
+// The fixture of the tests of trace.h: a fake journal, and a look at this program's sockets to it.
 
 #pragma once
 
@@ -15,7 +15,7 @@
 
 class TraceTest : public ::testing::Test {
  protected:
-  // Each test has a journal of its own, so the socket of the one before is of no use.
+  // Each test makes another journal, so a socket to the previous one must be closed.
   void SetUp() override { closeTraceSockets(); }
 
   static tessel_point somePoint() {

@@ -1,5 +1,5 @@
-// That recording never stands in a program's way: journals that end and fill up, descriptors that
-// change hands, forks, threads, and the switches.
+// Recording must never harm the program that records: while the journal ends or is full, after the
+// program closed or reused descriptors, after a fork, in threads, and when it is switched off.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

@@ -1,4 +1,4 @@
-// What trace.h puts into the journal's socket, and what it refuses.
+// The datagrams that trace.h sends to the journal, and the points that it refuses.
 
 #include <fcntl.h>
 #include <gmock/gmock.h>
@@ -108,7 +108,7 @@ TEST_P(TraceHeaderIn, NumbersDoNotSpeakTheLanguageOfTheUser) {
   EXPECT_EQ(entry["TESSEL_NUMBER2_VALUE"], "1.5e-20");
 }
 
-// A comma, and a character of two bytes.
+// A comma, and an Arabic decimal separator, which takes two bytes.
 INSTANTIATE_TEST_SUITE_P(DecimalPoints, TraceHeaderIn, ::testing::Values("<U002C>", "<U066B>"));
 
 struct Refusal {
@@ -205,7 +205,8 @@ TEST_F(TraceHeader, WhatTheBufferCannotHoldTravelsAsSealedFile) {
   EXPECT_EQ(entry.fields.back().second, std::string("Filler=") + (kLongest.c_str() + 100));
 }
 
-// Every size around the end of the buffer arrives whole, whichever way it goes.
+// trace.h sends small entries from a buffer and large ones through a file. Sizes around the limit
+// must arrive whole either way.
 TEST_F(TraceHeader, NothingIsLostWhereTheBufferEnds) {
   tessel_point point = somePoint();
   point.string1 = {"label", kLongest.c_str()};

@@ -1,4 +1,4 @@
-// The C++ side: points by chain, intervals by scope.
+// The C++ classes of trace.h: points by chained calls, intervals that end with their scope.
 
 #include "TraceTest.h"
 
