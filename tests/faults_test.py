@@ -240,6 +240,7 @@ class CutJournal(MachineTest):
 
 class Permission(MachineTest):
     def test_files_without_permission_are_named(self):
+        harness.require_root()
         for number in range(6):
             entries = [point("event", "com.vantor.Calendar", "View", f"Open{number}", at=-100 + number)]
             self.machine.write_export(entries, f"{number}.export", first_sequence=1 + number)

@@ -234,6 +234,10 @@ def wait_for(condition, seconds=60):
         time.sleep(0.005)
 
 
+def require_root():
+    assert os.geteuid() == 0, "only root can run programs as another user; leave this out with ./test dev -LE root"
+
+
 def interrupt(process):
     process.send_signal(signal.SIGINT)
 

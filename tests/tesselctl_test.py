@@ -89,6 +89,7 @@ class Statuses(CtlTest):
                 self.assertLessEqual(len(line), 95, line)
 
     def test_without_access_the_hint_says_what_to_do(self):
+        harness.require_root()
         self.machine.write_export([log_event("x")])
         os.chmod(self.machine.root, 0o755)
         for folder in (self.machine.store, self.machine.state):
@@ -210,6 +211,7 @@ class Events(CtlTest):
         wait_for_name("of the new spool")
 
     def test_a_reader_who_may_only_read_sees_them(self):
+        harness.require_root()
         for path, mode in ((self.machine.root, 0o755), (self.machine.state, 0o755), (self.spool(), 0o644)):
             os.chmod(path, mode)
         result = self.as_nobody("events")
