@@ -1,5 +1,5 @@
-// Any bytes as a file in the Journal Export Format: read to the end, then read again after the file
-// grew by a good entry, which must come out unless the bytes end within a value.
+// Any bytes as a file in the Journal Export Format. The reader must come to an end, and must go on
+// when the file has grown by a good entry, as a file that is being written does.
 
 #include <fcntl.h>
 #include <sys/mman.h>
@@ -34,7 +34,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   static const int file = ::memfd_create("export", 0);
   if (::ftruncate(file, 0) != 0) std::abort();
   append(file, data, size);
-  // A description of its own, with its own place in the file.
+  // Opened anew: a duplicate descriptor would share the read position with ours.
   const std::string path = "/proc/self/fd/" + std::to_string(file);
   tessel::TracePointTable table({.fields = 64, .textBytes = size_t{64} << 10});
   tessel::StopFlag stop = false;

@@ -1,9 +1,9 @@
-// Any bytes as a journal file. What is delivered must keep to the file's own limits: no entry
-// twice, no value beyond what is shown of one, an end.
+// Any bytes as a journal file. The reader must come to an end, deliver no more entries than the
+// file has room for, and cut values at their limit.
 //
-// A real journal file has a table of megabytes, mostly zeros, that the reader never looks at. An
-// input therefore begins with where such a stretch stands and how long it is, 32 bits each; the
-// file is made with a hole there.
+// A real journal file has a hash table of megabytes, mostly zeros, that the reader never looks at.
+// Inputs of that size would slow the fuzzer down. So an input begins with the place and the length
+// of that table, 32 bits each, and the file is made with a hole there.
 
 #include <sys/mman.h>
 #include <unistd.h>
@@ -57,8 +57,8 @@ void readAll(JournalEntryStream& stream, TracePointTable& table, size_t most) {
   }
 }
 
-// Each input is read as one more file of the same store, so that the megabytes that files share are
-// made once for many.
+// The files of a store share megabytes of memory. Each input is read as one more file of the same
+// store, so that this memory is made once for many inputs.
 uint32_t nextNumber() {
   static uint32_t runs = 0;
   return runs++ % JournalStore::kMaxFiles;

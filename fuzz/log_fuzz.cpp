@@ -1,4 +1,5 @@
-// Any strings and numbers as the arguments of log messages, and what of them reaches a terminal.
+// Any strings and numbers as the arguments of log messages. No control character of theirs may
+// reach a terminal.
 
 #include <cmath>
 #include <cstdint>
@@ -35,7 +36,7 @@ bool isPlain(std::string_view text) {
   return isValidUtf8(text);
 }
 
-// A text of the fuzzer's own, as far as its conversions fit the arguments that there are.
+// Formats a message text of the input, if its conversions fit the three arguments that we have.
 void formatFreely(std::string_view text, std::string_view word, uint64_t number, double real) {
   using detail::LogArgumentKind;
   size_t words = 0;

@@ -1,5 +1,5 @@
-// Any name and any text as a row of the spool, and any body as a collector's answer. What is sent
-// must be JSON, and the same row must yield the same bytes.
+// Any name and any text as a row of the spool, and any body as a collector's answer. The forwarder
+// must send valid JSON, and the same bytes for the same row: a retry sends the row again.
 
 #include <cstdint>
 #include <cstdlib>

@@ -1,7 +1,8 @@
-// Any fields in any entries: decoded and assembled under limits so tight that every one is met.
+// Any fields in any entries, decoded and assembled. The limits on memory are so low that inputs
+// reach all of them.
 //
-// A line of the input is a field, an empty line ends an entry; the first byte of an entry moves the
-// clock and picks the boot.
+// A line of the input is a field, and an empty line ends an entry. The first byte of an entry moves
+// the clock and picks the boot.
 
 #include <cstdint>
 #include <cstdlib>
@@ -15,7 +16,7 @@ namespace {
 
 using namespace tessel;
 
-// Keeps the last few objects and reads them when others have long followed.
+// Keeps the last objects and reads them later: their strings must outlive the entry they came from.
 class KeepingSink final : public TraceObjectSink {
  public:
   bool admits(StringRef subsystem, StringRef category) override {
