@@ -1,3 +1,5 @@
+// One function for each format that the journal daemon can be built with.
+
 #include "journal/Decompressor.h"
 
 #include <lz4.h>
@@ -12,13 +14,16 @@ namespace tessel {
 
 namespace {
 
+// Read at once. The shown beginning of a value, some 4 KiB, rarely needs more compressed bytes.
 constexpr size_t kInputSize = size_t{16} << 10;
-// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD).
+// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD). A payload that asks
+// for much more was not written by it and would only make us allocate. 2^22 bytes are 4 MiB.
 constexpr uint64_t kXzMemoryLimit = uint64_t{8} << 20;
 constexpr int kZstdLargestWindowLog = 22;
 
 }  // namespace
 
+// Making a context costs more than decompressing a value, so it is kept. XZ has nothing to keep.
 struct Decompressor::ZstdContext {
   ZSTD_DCtx* context = ZSTD_createDCtx();
   ZstdContext() { ZSTD_DCtx_setParameter(context, ZSTD_d_windowLogMax, kZstdLargestWindowLog); }
@@ -67,8 +72,8 @@ std::optional<Decompressor::Result> Decompressor::decompressXz(const Source& sou
   return Result{target.size(), false};
 }
 
-// The size of the text, then one block. Its beginning needs hardly more of the block than it is
-// long.
+// The payload is the size of the text, eight bytes, and one block. Text that compresses badly makes
+// a block hardly longer than the text, so input_ holds what the shown beginning needs.
 std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& source,
                                                                 std::span<uint8_t> target) {
   constexpr size_t kSizeBytes = 8;
@@ -86,6 +91,7 @@ std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& so
 
 std::optional<Decompressor::Result> Decompressor::decompressZstd(const Source& source,
                                                                  std::span<uint8_t> target) {
+  // Most stores are not compressed with ZSTD, or have no long value, so the context waits for one.
   if (!zstd_) zstd_ = std::make_unique<ZstdContext>();
   ZSTD_DCtx_reset(zstd_->context, ZSTD_reset_session_only);
   ZSTD_outBuffer output{target.data(), target.size(), 0};

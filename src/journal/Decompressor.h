@@ -1,6 +1,7 @@
-// Decompressor: the beginning of a compressed payload, by XZ, LZ4 or ZSTD.
+// Decompressor: the beginning of a payload that was compressed with XZ, LZ4 or ZSTD.
 //
-// Never more is produced than asked for, and the memory that a payload may claim is limited.
+// It never produces more than the caller asks for, so a small payload that claims to be gigabytes
+// costs nothing. What a payload may make the libraries allocate is bounded too.
 //
 // Threads: one at a time.
 
@@ -17,12 +18,12 @@ namespace tessel {
 
 class Decompressor {
  public:
-  // Reads from the compressed payload at `position` into `target`; answers how much, 0 at its end.
+  // Reads the compressed bytes from `position` on into `target`; returns how many, 0 at the end.
   using Source = std::function<size_t(uint64_t position, std::span<uint8_t> target)>;
 
   struct Result {
     size_t produced = 0;
-    bool complete = false;  // whether that was all
+    bool complete = false;  // whether `produced` is the whole payload
   };
 
   Decompressor();
@@ -30,8 +31,8 @@ class Decompressor {
   Decompressor(const Decompressor&) = delete;
   Decompressor& operator=(const Decompressor&) = delete;
 
-  // Fills `target` with the beginning of the payload. `compression` is one of
-  // journal_format::DataFlag. Nothing where the payload is damaged or claims too much.
+  // Fills `target` with the beginning of the payload. `compression` is one
+  // journal_format::DataFlag. Nothing if the payload is damaged or needs too much memory.
   std::optional<Result> decompress(uint8_t compression, const Source& source,
                                    std::span<uint8_t> target);
 

@@ -1,3 +1,5 @@
+// Chains of entry arrays, and the walk from the table of fields to the lists of entries.
+
 #include "journal/EntryIndex.h"
 
 #include <algorithm>
@@ -10,7 +12,9 @@ namespace tessel {
 using namespace journal_format;
 
 namespace {
-constexpr size_t kSmallestPiece = 256;  // bytes
+// Bytes. The windows of thousands of files are small, and the pieces of their chains with them; yet
+// a piece of 32 entries keeps system calls rare.
+constexpr size_t kSmallestPiece = 256;
 }  // namespace
 
 EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count, size_t largestPiece)
@@ -28,7 +32,8 @@ uint64_t EntryChain::firstOfNextPiece() {
   return more ? last_ = itemAt(pieceNext_++) : 0;
 }
 
-// Makes the array at `offset` the one that is read.
+// Makes the array at `offset` the one that is read. The daemon appends arrays, so a link only leads
+// forward in an intact file; demanding that also ends a circle of links.
 bool EntryChain::enterArray(uint64_t offset) {
   const uint64_t previous = std::exchange(array_, 0);
   if (offset <= previous || !file_.mayHoldObject(offset, kArrayItemsAt)) return false;
@@ -47,6 +52,7 @@ void EntryChain::finishArray() {
   const uint64_t next = nextArray_;
   const uint64_t last = array_;
   if (next == 0) {
+    // The end of a chain and a link that was zeroed look alike. The count tells them apart.
     array_ = 0;
     if (listed_ < count_) damagedAt(last);
   } else if (!enterArray(next)) {
@@ -54,7 +60,7 @@ void EntryChain::finishArray() {
   }
 }
 
-// Reads the next piece, perhaps an empty one; false where the chain has ended.
+// Reads the next piece, which may be empty; false if the chain has ended.
 bool EntryChain::loadPiece() {
   if (array_ == 0) return false;
   const bool growing = file_.header().beingWritten();
@@ -67,7 +73,8 @@ bool EntryChain::loadPiece() {
     return array_ != 0;
   }
   uint64_t count = std::min<uint64_t>(arraySize_ - arrayIndex_, pieceBytes_ / itemSize_);
-  // Items are linked in order, so what stands beyond the count was not linked when we looked.
+  // The daemon links entries in order and counts them last. So items beyond the count were linked
+  // after we read the header, and their entries may be unfinished.
   if (growing) count = std::min(count, count_ - listed_);
   if (!takePiece(static_cast<size_t>(count)))
     damagedAt(array_ + kArrayItemsAt + arrayIndex_ * itemSize_);
@@ -76,7 +83,8 @@ bool EntryChain::loadPiece() {
   return true;
 }
 
-// Reads `count` items. False where they are not usable; the piece is empty then.
+// Reads `count` items. False if they are not usable, and then the piece is empty. One bad offset
+// condemns the whole piece: damage is rarely one word, and the search finds all its entries anyway.
 bool EntryChain::takePiece(size_t count) {
   pieceSize_ = pieceNext_ = 0;
   const uint64_t from = array_ + kArrayItemsAt + arrayIndex_ * itemSize_;
@@ -86,7 +94,7 @@ bool EntryChain::takePiece(size_t count) {
   for (size_t i = 0; i < count; ++i) {
     const uint64_t offset = itemAt(i);
     if (offset <= previous || !file_.mayHoldObject(offset, kEntryItemsAt)) {
-      // Behind the last entry an array is filled with zeros, or with what was linked meanwhile.
+      // The array is longer than its entries: zeros follow, or entries that were linked meanwhile.
       if (listed_ + i < count_) return false;
       pieceSize_ = i;
       array_ = 0;
@@ -100,12 +108,14 @@ bool EntryChain::takePiece(size_t count) {
 
 namespace {
 
-// A file with more fields, or more values of a marked one, is read without its index.
+// Reading the index costs one read for each field and each value. A file with more of them was made
+// to cost time; it is read without its index. A real one has some hundred fields, and a marked
+// field has three values, one list each.
 constexpr uint64_t kMaxFields = 4096;
-constexpr uint64_t kMaxFieldTable = uint64_t{1} << 20;  // bytes
+constexpr uint64_t kMaxFieldTable = uint64_t{1} << 20;  // bytes; real tables have 5 KiB
 constexpr size_t kMaxValues = 1024;
 constexpr size_t kMaxLists = 16;
-constexpr size_t kListPiece = 1024;  // bytes that are read of a list at once
+constexpr size_t kListPiece = 1024;  // bytes; a quarter of a chain's, because there are many lists
 
 std::string_view textAt(const uint8_t* at, size_t size) {
   return {reinterpret_cast<const char*>(at), size};
@@ -113,8 +123,9 @@ std::string_view textAt(const uint8_t* at, size_t size) {
 
 }  // namespace
 
-// Follows the index from the table of fields to the lists. Every step answers false where the index
-// does not hold.
+// Walks from the table of fields to the values of the marked ones and to their lists. Every step
+// returns false if the index does not hold. All reads go past the window, which stays where the
+// entries begin.
 class MarkedEntries::IndexReader {
  public:
   IndexReader(JournalFile& file, const StopFlag& stop) : file_(file), stop_(stop) {}
@@ -147,12 +158,12 @@ class MarkedEntries::IndexReader {
 
   JournalFile& file_;
   const StopFlag& stop_;
-  std::vector<Field> fields_;  // that are looked for
-  uint64_t found_ = 0;         // fields of all names
+  std::vector<Field> fields_;  // the fields of all marks and their companions
+  uint64_t found_ = 0;         // how many fields the table led to, whatever their names
   std::vector<List> lists_;
 };
 
-// Reads the beginning of an object of one type, `least` bytes or more of it.
+// Reads the beginning of an object of type `type` into `target`; at least `least` bytes, if true.
 bool MarkedEntries::IndexReader::readObject(uint64_t offset, ObjectType type, size_t least,
                                             std::span<uint8_t> target) {
   if (stopped() || !file_.mayHoldObject(offset, least)) return false;
@@ -184,7 +195,8 @@ bool MarkedEntries::IndexReader::findFields() {
   return found_ == header.fieldCount;
 }
 
-// Looks at the fields of one bucket, of which the first is at `offset`; 0: it is empty.
+// Looks at the fields of one bucket. The first is at `offset`; 0: the bucket is empty. Counting all
+// fields ends a circle and shows afterwards whether one was missed.
 bool MarkedEntries::IndexReader::followBucket(uint64_t offset) {
   std::array<uint8_t, kFieldHeaderSize + kMaxFieldNameLength> bytes;
   while (offset != 0) {
@@ -202,7 +214,8 @@ bool MarkedEntries::IndexReader::followBucket(uint64_t offset) {
   return true;
 }
 
-// Companions must stand in as many entries as the field that they accompany.
+// If a companion stood in an entry without the field, the field's lists alone would hide that
+// entry. The counts show it without reading the companions' lists.
 bool MarkedEntries::IndexReader::take(const EntryMark& mark) {
   uint64_t entries = 0;
   if (!takeValues(mark.field, mark.value, true, entries)) return false;
@@ -212,8 +225,9 @@ bool MarkedEntries::IndexReader::take(const EntryMark& mark) {
   });
 }
 
-// Looks at the values of a field, of which each was put before those that are older. Counts the
-// entries that refer to them and, where they are to be `listed`, takes their lists.
+// Looks at the values of a field, the newest first. Counts the entries that refer to them and, if
+// `listed`, takes their lists. A compressed value does not begin with the name, so a file that has
+// one is read without its index.
 bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_view value,
                                             bool listed, uint64_t& entries) {
   const size_t headerSize = file_.dataHeaderSize();
@@ -259,12 +273,14 @@ std::unique_ptr<MarkedEntries> MarkedEntries::of(JournalFile& file,
   auto marked = std::make_unique<MarkedEntries>();
   marked->lists_ = reader.lists();
   if (marked->lists_.size() > listsLeft) return nullptr;
-  listsLeft -= marked->lists_.size();
+  listsLeft -= marked->lists_.size();  // not given back: files of a store are opened together
   marked->nearest_ = kNone;
   for (const List& list : marked->lists_) marked->nearest_ = std::min(marked->nearest_, list.next);
   return marked;
 }
 
+// Called only for an entry at or behind the nearest listed one. If it is behind, the list names an
+// offset where no entry was.
 bool MarkedEntries::look(uint64_t offset) {
   missed_ = nearest_ < offset;
   usable_ = !missed_;
@@ -276,7 +292,9 @@ bool MarkedEntries::look(uint64_t offset) {
   return true;
 }
 
-// False where the list goes on in a place that is damaged, or beyond its end.
+// False if the list is damaged or longer or shorter than its value says. We look one entry further
+// than we need: an offset that is too large would otherwise hide all marked entries up to it, until
+// the reader gets there.
 bool MarkedEntries::lookAhead(List& list) {
   const uint64_t ahead = list.rest.next();
   const bool more = list.left != 0;

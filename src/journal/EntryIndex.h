@@ -1,23 +1,25 @@
-// EntryChain: the offsets of entries as a chain of entry arrays of a journal file lists them: all
-// entries of the file, or those that refer to one data object.
+// The index of a journal file: which entries it has, and which of them have a certain field.
 //
-// The chain is read in pieces, small beside the windows of the files. A piece whose offsets are not
-// all possible and strictly increasing is not used at all, and a broken link ends the chain: in
-// both cases the caller is told that entries may lie in between, to look for them in line.
+// EntryChain reads a chain of entry arrays. One chain lists all entries of a file, and each data
+// object has one that lists the entries which refer to it. Offsets in a chain rise. A piece of a
+// chain that breaks this rule is not used at all, and a broken link ends the chain; the caller
+// learns that entries may be missing before the next one, and searches there.
 //
-// Threads: one at a time.
+// MarkedEntries says which entries are worth looking into. Most entries of a day are not, and to
+// read the fields of all would be most of the work. So it follows the lists of the few values that
+// matter, and of all other entries the reader reads the header alone.
 //
-// MarkedEntries: which entries of a closed journal file carry a mark, as the file's own index says.
+// The danger: a wrong index hides entries without a word. So the index is used only if
+//   - the file is closed, because a writer links an entry in several steps;
+//   - as many fields are found as the header counts;
+//   - each value of a field is older than the one that links to it, which rules out circles;
+//   - companions stand in as many entries as the field that they accompany.
+// While it is followed, each list must be as long as its value says, must rise, and each listed
+// entry must be met. If one of these fails, every further entry is looked into. A wrong offset in a
+// list can then hide one entry, the one that it replaced. Looking up each entry in the lists of its
+// values would find even that, but reads the fields that this saves.
 //
-// A file keeps for each field the values that it has, and for each value the entries that refer to
-// it. Most entries of a day carry no mark, and with the lists of those that do, nothing but the
-// header of the others needs to be looked at. What the index says is held against itself wherever
-// that is possible: all fields must be found that the file counts, every list must be as long as
-// the value says, and each listed entry must be met. Where one of these fails, the index is given
-// up and every entry is looked at. All that a wrong offset in a list can hide is the entry that it
-// stood for.
-//
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -33,22 +35,24 @@ namespace tessel {
 
 class EntryChain {
  public:
-  static constexpr size_t kLargestPiece = 4096;  // bytes
+  // Bytes that are read at once, at most: 512 entries for one system call, and little beside the
+  // window of the file.
+  static constexpr size_t kLargestPiece = 4096;
 
-  // The chain that begins with the array at `first` and lists `count` entries. `file` must outlive
-  // the chain.
+  // The chain that begins with the array at offset `first` and should list `count` entries. `file`
+  // must outlive the chain.
   EntryChain(JournalFile& file, uint64_t first, uint64_t count,
              size_t largestPiece = kLargestPiece);
 
-  // The offset of the next entry, greater than all before; 0 where the chain ends.
+  // The offset of the next entry, greater than all before it; 0 at the end of the chain.
   uint64_t next() {
     gapBefore_ = false;
     if (pieceNext_ == pieceSize_) [[unlikely]]
       return firstOfNextPiece();
     return last_ = itemAt(pieceNext_++);
   }
-  // Whether entries that the chain does not list may come before what next() answered, and where
-  // the chain is damaged there.
+  // Whether the chain is damaged before the entry that next() returned, so that entries may be
+  // missing there; and the offset of the damage.
   bool gapBefore() const { return gapBefore_; }
   uint64_t problemAt() const { return problemAt_; }
 
@@ -72,51 +76,50 @@ class EntryChain {
   const size_t itemSize_;
   const uint64_t count_;
   const size_t pieceBytes_;
-  std::unique_ptr<uint8_t[]> piece_;  // from when the first is read
+  std::unique_ptr<uint8_t[]> piece_;  // null until the first piece is read
   size_t pieceSize_ = 0;              // in items
   size_t pieceNext_ = 0;
   uint64_t array_ = 0;       // offset of the array that is read; 0: none is left
-  uint64_t nextArray_ = 0;   // the one it links to
-  uint64_t arraySize_ = 0;   // items it holds
-  uint64_t arrayIndex_ = 0;  // items of it that were read
+  uint64_t nextArray_ = 0;   // offset of the array that it links to
+  uint64_t arraySize_ = 0;   // in items
+  uint64_t arrayIndex_ = 0;  // items of the array that were read
   uint64_t listed_ = 0;      // items read in all arrays
-  uint64_t last_ = 0;        // greatest offset handed out
-  bool gap_ = false;         // since what was last handed out
-  bool gapBefore_ = false;   // before it
+  uint64_t last_ = 0;        // what next() returned last
+  bool gap_ = false;         // damage was met since then
+  bool gapBefore_ = false;
   uint64_t problemAt_ = 0;
 };
 
 class MarkedEntries {
  public:
-  // Lists that the files of one store follow at once, to bound their memory.
+  // Lists that all files of a store together follow at once. Each holds a piece of up to 1 KiB, so
+  // they take up to 4 MiB. Files that come later are read without their index.
   static constexpr size_t kMaxListsOfStore = 4096;
 
-  // Reads the index of `file`, which must outlive the answer. Null where `marks` is empty, or where
-  // the index does not tell: the file is still written, is damaged, has too many values, has
-  // companions of a mark in entries without it; where the lists are more than `listsLeft`, from
-  // which they are taken; or when `stop` is set.
+  // Reads the index of `file`, which must outlive the result, and takes its lists from `listsLeft`.
+  // Null if every entry must be looked into: `marks` is empty, the index does not hold, there are
+  // too many values or not enough lists left, or `stop` was set.
   static std::unique_ptr<MarkedEntries> of(JournalFile& file, std::span<const EntryMark> marks,
                                            size_t& listsLeft, const StopFlag& stop);
 
-  // Whether the entry at `offset` carries a mark. REQUIRES: every entry of the file is asked about,
-  // in order, up to the first time that usable() answers false.
+  // Whether the entry at `offset` has a mark. REQUIRES: the caller asks about every entry of the
+  // file, in order, until usable() returns false.
   bool has(uint64_t offset) { return offset >= nearest_ && look(offset); }
-  // Whether the lists can be followed beyond the last marked entry.
+  // False: the lists are damaged behind the last marked entry.
   bool usable() const { return usable_; }
-  // Whether that is because a place that they list held no entry: one may have been passed over.
+  // Whether a list named an offset that is no entry. An entry may have been passed over there.
   bool missed() const { return missed_; }
-  // Whether an entry is listed that was not asked about yet.
+  // Whether an entry is listed that the caller has not asked about yet.
   bool awaitsMore() const { return nearest_ != kNone; }
 
  private:
   static constexpr uint64_t kNone = UINT64_MAX;
 
   struct List {
-    EntryChain rest;    // behind the first entry, which the value itself names
-    uint64_t left = 0;  // of `rest`
-    uint64_t next = 0;  // offset of the entry that comes next; kNone: there is none
-    // The one behind it, so that an offset that is too large is found before it is waited for.
-    uint64_t ahead = 0;
+    EntryChain rest;     // all entries but the first, whose offset stands in the data object
+    uint64_t left = 0;   // entries of `rest` that are still to be read
+    uint64_t next = 0;   // offset of the entry that comes next; kNone: there is none
+    uint64_t ahead = 0;  // the one after it
   };
 
   class IndexReader;
@@ -126,7 +129,7 @@ class MarkedEntries {
   static bool advance(List& list);
 
   std::vector<List> lists_;
-  uint64_t nearest_ = 0;  // the least `next`
+  uint64_t nearest_ = 0;  // the smallest `next` of all lists
   bool usable_ = true;
   bool missed_ = false;
 };

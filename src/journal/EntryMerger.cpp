@@ -1,24 +1,33 @@
+// A heap of streams, with a shortcut for the case that one stream leads for a long time.
+
 #include "journal/EntryMerger.h"
 
 #include <algorithm>
 #include <tuple>
 #include <utility>
 
+#include "platform/Invariant.h"
+
 namespace tessel {
 
 namespace {
 constexpr Id128 kNoId{};
-}
+// Greater than every number of a file, so that one number says which of the two it is.
+constexpr uint32_t kFirstSequence = 0x80000000;
+}  // namespace
 
 bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
   if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) &&
       a.sequenceNumber != b.sequenceNumber)
     return a.sequenceNumber < b.sequenceNumber;
   if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
+  // Hash and boot decide between equal times, so that the order does not depend on which file was
+  // opened first and two runs over one store agree.
   return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
          std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
 }
 
+// The number differs nearly always, so it is compared first and the ids last.
 bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
   return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
          a.realtime == b.realtime && a.monotonic == b.monotonic && sameId(a.bootId, b.bootId) &&
@@ -26,12 +35,14 @@ bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
 }
 
 void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
-  Source source{std::move(stream), nullptr, number, 0};
+  TESSEL_INVARIANT(!started_);  // the heap is put in order once, by the first next()
+  Source source{std::move(stream), nullptr, number};
   if (source.next()) heap_.push_back(std::move(source));
 }
 
 bool EntryMerger::next() {
   if (started_ && !heap_.empty()) {
+    // Copies are skipped before the front moves on, because they are compared with its entry.
     dropDuplicates();
     advanceFirst();
   } else if (!started_) {
@@ -43,7 +54,8 @@ bool EntryMerger::next() {
   return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
 }
 
-// Most entries are followed by one of the same stream; then nothing moves.
+// Files follow one another in time, so the next entry is nearly always from the same stream. We
+// remember which stream comes second: one comparison with it shows that nothing has to move.
 void EntryMerger::advanceFirst() {
   const bool more = heap_.front().next();
   if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
@@ -59,7 +71,7 @@ void EntryMerger::close(size_t index) {
   heap_.pop_back();
 }
 
-// The index of the stream that comes first but for the very first; 0: there is none.
+// In a heap the second stream is one of the two below the first.
 size_t EntryMerger::findRunnerUp() const {
   if (heap_.size() < 2) return 0;
   return heap_.size() > 2 && comesBefore(*heap_[2].header, *heap_[1].header) ? 2 : 1;
@@ -76,42 +88,24 @@ void EntryMerger::siftDown(size_t index) {
   }
 }
 
-// Skips the current entry, once, in all streams but its own. What equals the first of the heap can
-// only be right below it, and what is below that comes up when it is skipped.
+// Skips the current entry in all other streams, at most once in each: a stream that has it twice
+// was written twice. A copy compares equal to the front, so in a heap nothing but another copy can
+// stand between them. It is enough to look at the two places below the front: when a copy there is
+// skipped, siftDown() brings up what was below it.
 void EntryMerger::dropDuplicates() {
   for (size_t child = 1; child <= 2 && child < heap_.size();) {
-    if (heap_[child].droppedAt == current_ ||
+    if (heap_[child].skippedFor == current_ ||
         !sameEntry(*heap_[child].header, *heap_.front().header)) [[likely]] {
       ++child;
       continue;
     }
-    heap_[child].droppedAt = current_;
+    heap_[child].skippedFor = current_;
     ++duplicates_;
     if (!heap_[child].next()) close(child);
     siftDown(child);
     runnerUp_ = findRunnerUp();
   }
 }
-
-namespace {
-constexpr uint32_t kFirstSequence = 0x80000000;
-}
-
-class StoreMerger::Sequence final : public EntryStream {
- public:
-  Sequence(const StopFlag& stop, uint64_t& duplicates, Streams& streams)
-      : merger_(stop, duplicates) {
-    for (auto& [stream, number] : streams) merger_.add(std::move(stream), number);
-  }
-
-  bool next() override { return merger_.next(); }
-  const EntryHeader& header() const override { return merger_.header(); }
-  Entry entry() override { return merger_.entry(); }
-  uint32_t streamNumber() const { return merger_.streamNumber(); }
-
- private:
-  EntryMerger merger_;
-};
 
 void StoreMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence) {
   waiting_[sequence].emplace_back(std::move(stream), number);
@@ -122,6 +116,8 @@ bool StoreMerger::next() {
   return all_.next();
 }
 
+// Files of no known sequence, and a file that is the only one of its sequence, need no merger of
+// their own.
 void StoreMerger::start() {
   for (auto& [sequence, streams] : std::exchange(waiting_, {})) {
     if (sequence != Id128{} && streams.size() > 1) {
@@ -134,7 +130,8 @@ void StoreMerger::start() {
 
 void StoreMerger::addSequence(Streams& streams) {
   const auto number = kFirstSequence + static_cast<uint32_t>(sequences_.size());
-  auto sequence = std::make_unique<Sequence>(stop_, duplicates_, streams);
+  auto sequence = std::make_unique<EntryMerger>(stop_, duplicates_);
+  for (auto& [stream, file] : streams) sequence->add(std::move(stream), file);
   sequences_.push_back(sequence.get());
   all_.add(std::move(sequence), number);
 }

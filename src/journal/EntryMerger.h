@@ -1,27 +1,24 @@
-// EntryMerger: many entry streams as one, in the journal's own order.
+// Merging: many entry streams as one, in the journal's own order, each entry once.
 //
-// Of two entries, the one with the lower number comes first where both count in the same sequence,
-// else the earlier by the monotonic clock where both are of one boot, else the earlier by the wall
-// clock. An entry that stands in several streams is delivered once, where that order does not run
-// in a circle; equal entries of one stream are all delivered.
+// Which of two entries comes first? If both count in the same sequence, the one with the lower
+// number: the daemon gave the numbers, so this is always right. Otherwise, if both are of one boot,
+// the earlier one by the monotonic clock. Otherwise the earlier one by the wall clock.
 //
-// Threads: one at a time, but for the stop flag.
+// Taken together these rules are no order. With one entry of another sequence between two numbers,
+// and a clock that was set back, A can come before B, B before C, and C before A. A merge then
+// still delivers every entry, but copies of one entry, which stand in an archived file and in a
+// copy of it, may come up far apart, so that the merge does not see that they are equal. Therefore
+// StoreMerger first merges the files of each sequence, where numbers alone decide and copies always
+// meet, and only then the sequences. The price is one comparison more for each entry. Remembering
+// every entry that was delivered would also find the copies, but takes memory without bound.
 //
-// StoreMerger: the files of a store as one stream, in the journal's own order.
-//
-// The order between files of several sequences may run in a circle, where a clock was set or boots
-// overlap: what is met twice could then lie far apart. So the files of one sequence, whose order is
-// never in doubt, are merged first, and an entry that stands in several of them is left out there.
-//
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <optional>
-#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -31,17 +28,20 @@ namespace tessel {
 
 // Whether `a` comes before `b`.
 bool comesBefore(const EntryHeader& a, const EntryHeader& b);
-// Whether both are the same entry, found in two places. An entry of no sequence, or without a hash,
-// is the same as none.
+// Whether both are copies of one entry. An entry without a sequence or a hash has no copies: two
+// like it cannot be told from two different entries, and showing one twice loses nothing.
 bool sameEntry(const EntryHeader& a, const EntryHeader& b);
 
+// Merges streams with a heap. An entry that stands in several streams is delivered once, as long as
+// the order of these streams does not run in a circle. Equal entries of one stream are all
+// delivered, because they are entries that were written twice.
 class EntryMerger final : public EntryStream {
  public:
-  // Adds to `duplicates` the entries that it leaves out as they stand in another stream as well.
-  // Both must outlive the merger.
+  // Counts in `duplicates` the copies that it leaves out. Both must outlive the merger.
   EntryMerger(const StopFlag& stop, uint64_t& duplicates) : stop_(stop), duplicates_(duplicates) {}
 
-  // Adds a stream; it is asked for its first entry at once, and closed after its last.
+  // Adds a stream. It is asked for its first entry at once and destroyed after its last, which
+  // closes its file and leaves more of the window budget to the others.
   // REQUIRES: next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
@@ -62,7 +62,8 @@ class EntryMerger final : public EntryStream {
     std::unique_ptr<EntryStream> stream;
     const EntryHeader* header;  // of its current entry
     uint32_t number;
-    uint64_t droppedAt = 0;  // of the current entries, by count, the last that it lost a twin of
+    // The value of current_ when we last skipped an entry of this stream as a copy.
+    uint64_t skippedFor = 0;
   };
 
   void advanceFirst();
@@ -73,18 +74,19 @@ class EntryMerger final : public EntryStream {
 
   const StopFlag& stop_;
   uint64_t& duplicates_;
-  std::vector<Source> heap_;
-  size_t runnerUp_ = 0;
+  std::vector<Source> heap_;  // the stream with the entry that comes first is at the front
+  size_t runnerUp_ = 0;       // index of the stream that comes second; 0: there is none
   bool started_ = false;
-  uint64_t current_ = 0;  // entries delivered, the current one included
+  uint64_t current_ = 0;  // number of calls of next()
 };
 
+// Merges all streams of a store: first those of each sequence, then the results.
 class StoreMerger final : public EntryStream {
  public:
   // `stop` must outlive the merger.
   explicit StoreMerger(const StopFlag& stop) : stop_(stop), all_(stop, duplicates_) {}
 
-  // Adds a stream whose entries all count in `sequence`; all zero: in none, or in several.
+  // Adds a stream whose entries all count in `sequence`. All zero: they may count in any.
   // REQUIRES: next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence);
 
@@ -93,21 +95,20 @@ class StoreMerger final : public EntryStream {
   Entry entry() override { return all_.entry(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
   uint32_t streamNumber() const;
-  // Entries left out as they stand in another stream as well.
+  // How many copies of entries were left out.
   uint64_t duplicates() const { return duplicates_; }
 
  private:
   using Streams = std::vector<std::pair<std::unique_ptr<EntryStream>, uint32_t>>;
-  class Sequence;
 
   void start();
   void addSequence(Streams& streams);
 
   const StopFlag& stop_;
   uint64_t duplicates_ = 0;
-  std::map<Id128, Streams> waiting_;  // until the first entry is asked for
-  // Owned by all_, which knows one by the number that is its place here, behind those of streams.
-  std::vector<const Sequence*> sequences_;
+  std::map<Id128, Streams> waiting_;  // by sequence, until the first entry is asked for
+  // In all_, sequence i has the number kFirstSequence + i; all_ owns it.
+  std::vector<const EntryMerger*> sequences_;
   EntryMerger all_;
 };
 

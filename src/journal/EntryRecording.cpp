@@ -1,3 +1,5 @@
+// The text of an entry, and the ways to hand it over.
+
 #include "journal/EntryRecording.h"
 
 #include <fcntl.h>
@@ -19,6 +21,7 @@
 #include <system_error>
 
 #include "journal/EntryStream.h"
+#include "os/Files.h"
 #include "os/UniqueFd.h"
 
 namespace tessel {
@@ -27,9 +30,11 @@ namespace {
 
 constexpr std::string_view kEntryStart = "\n\n__CURSOR=";
 constexpr std::string_view kEntryEnd = "\n\n";
-// How much of the end of a file is searched for the last entry, at first and at most.
+// Bytes at the end of a file that are searched for the last entry: at first enough for a usual one,
+// at most enough for the largest that a reader keeps, with room to spare.
 constexpr off_t kFirstLook = off_t{64} * 1024;
 constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
+constexpr const char* kSocket = "/run/systemd/journal/socket";
 
 uint64_t microsecondsOf(clockid_t clock) {
   timespec now{};
@@ -45,10 +50,11 @@ std::string firstLineOf(const char* path) {
 }
 
 PlatformError failure(const std::string& path, const std::string& doing, int error) {
-  return {codeOf(error),
-          "Cannot " + doing + " " + path + ": " + std::generic_category().message(error)};
+  return {codeOf(error), "Cannot " + doing + " " + path + ": " + errorWords(error)};
 }
 
+// The daemon's hash depends on the file. Ours (FNV-1a) only has to be the same for equal entries,
+// so that a copied export file shows them as copies. XOR makes the order of the fields irrelevant.
 uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
   uint64_t all = 0;
   for (const RecordedField& field : fields) {
@@ -62,6 +68,8 @@ uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
 }
 
 void appendField(std::string& out, std::string_view name, std::string_view value) {
+  // A newline would end the field and other control characters garble a terminal, so a value with
+  // any of them is written with its length.
   const bool text = std::none_of(value.begin(), value.end(),
                                  [](char c) { return static_cast<uint8_t>(c) < ' ' && c != '\t'; });
   out += name;
@@ -86,14 +94,14 @@ std::string readAt(int fd, off_t offset, size_t count) {
 
 Id128 randomId() {
   Id128 id{};
-  // Cannot fall short for so few bytes.
+  // The kernel never returns fewer than it was asked for if that is at most 256 bytes.
   static_cast<void>(::getrandom(id.data(), id.size(), 0));
   return id;
 }
 
-// The header of the last entry in `tail`, which begins an entry or somewhere in one.
+// The header of the last entry in `tail`, which may begin within an entry.
 std::optional<EntryHeader> lastEntryIn(std::string_view tail) {
-  // Values may hold what looks like the start of an entry.
+  // A value may hold what looks like the start of an entry, so only a whole cursor counts.
   for (size_t at = tail.rfind(kEntryStart); at != std::string_view::npos;
        at = at == 0 ? std::string_view::npos : tail.rfind(kEntryStart, at - 1)) {
     std::string_view cursor = tail.substr(at + kEntryStart.size());
@@ -103,7 +111,7 @@ std::optional<EntryHeader> lastEntryIn(std::string_view tail) {
   return std::nullopt;
 }
 
-// The header of the last entry in the file; nothing where there is none that has a cursor.
+// The header of the last entry in the file; nothing if there is none with a cursor.
 std::optional<EntryHeader> lastEntry(int fd, off_t size) {
   for (off_t look = kFirstLook;; look *= 4) {
     const off_t from = std::max<off_t>(0, size - look);
@@ -114,23 +122,13 @@ std::optional<EntryHeader> lastEntry(int fd, off_t size) {
   }
 }
 
-bool writeAll(int fd, std::string_view text) {
-  while (!text.empty()) {
-    const ssize_t written = ::write(fd, text.data(), text.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written < 0) return false;
-    text.remove_prefix(static_cast<size_t>(written));
-  }
-  return true;
-}
-
 std::optional<PlatformError> appendLocked(int fd, const std::string& path,
                                           const RecordOrigin& origin,
                                           const std::vector<RecordedField>& fields) {
   struct stat status {};
   if (::fstat(fd, &status) != 0) return failure(path, "look at", errno);
   EntryHeader header;
-  // All entries of one file count in one sequence.
+  // All entries of one file count in one sequence, so that readers can tell which are missing.
   const std::optional<EntryHeader> last = lastEntry(fd, status.st_size);
   header.sequenceId = last ? last->sequenceId : randomId();
   header.sequenceNumber = last ? last->sequenceNumber + 1 : 1;
@@ -139,11 +137,13 @@ std::optional<PlatformError> appendLocked(int fd, const std::string& path,
   header.realtime = origin.realtime;
   header.contentHash = contentHashOf(fields);
   std::string text = exportText(header, origin, fields);
-  // A writer that was killed may have left half an entry; end it, so that ours is not part of it.
+  // A writer that was killed may have left half an entry. An empty line ends it, so that ours does
+  // not become part of it; the reader reports the half as bad.
   if (status.st_size > 0 && readAt(fd, std::max<off_t>(0, status.st_size - 2), 2) != kEntryEnd) {
     text.insert(0, kEntryEnd);
   }
   if (writeAll(fd, text)) return std::nullopt;
+  // Half an entry would stay incomplete forever, so what was written is taken back.
   const int error = errno;
   if (::ftruncate(fd, status.st_size) != 0)
     return failure(path, "take back half an entry in", errno);
@@ -191,26 +191,16 @@ std::optional<PlatformError> appendToExportFile(const std::string& directory,
   }
   const UniqueFd file(::open(path.c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
   if (!file.valid()) return failure(path, "open", errno);
+  // Sequence numbers come from the last entry: between looking and writing nobody else may append.
   while (::flock(file.get(), LOCK_EX) != 0) {
     if (errno != EINTR) return failure(path, "lock", errno);
   }
   return appendLocked(file.get(), path, origin, fields);
 }
 
-namespace {
-
-constexpr const char* kSocket = "/run/systemd/journal/socket";
-
-PlatformError failure(int error) {
-  return {codeOf(error), std::string("Cannot write to the journal at ") + kSocket + ": " +
-                             std::generic_category().message(error)};
-}
-
-}  // namespace
-
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields) {
-  // The library answers success where there is no daemon.
-  if (::access(kSocket, W_OK) != 0) return failure(errno);
+  // The library returns success if there is no daemon.
+  if (::access(kSocket, W_OK) != 0) return failure(kSocket, "write to the journal at", errno);
   std::vector<std::string> texts;
   texts.reserve(fields.size());
   for (const RecordedField& field : fields) texts.push_back(field.name + "=" + field.value);
@@ -218,7 +208,7 @@ std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fie
   parts.reserve(fields.size());
   for (std::string& text : texts) parts.push_back({text.data(), text.size()});
   const int result = ::sd_journal_sendv(parts.data(), static_cast<int>(parts.size()));
-  if (result < 0) return failure(-result);
+  if (result < 0) return failure(kSocket, "write to the journal at", -result);
   return std::nullopt;
 }
 

@@ -1,9 +1,9 @@
-// Appending entries to a file in the Journal Export Format, where no journal daemon runs.
+// Recording an entry: to the journal daemon, or to an export file where no daemon runs.
 //
-// Any number of processes may append to one file: each entry is written whole, under a lock of the
-// file. What the daemon would have added comes from the caller.
+// Any number of processes may append to one export file. Each entry is written whole, under a lock
+// of the file. What the daemon would have added to the entry comes from the caller.
 //
-// Sending an entry to the journal daemon of this machine.
+// Threads: any, at the same time.
 
 #pragma once
 
@@ -22,7 +22,7 @@ struct RecordedField {
   std::string value;
 };
 
-// What the journal daemon adds to an entry; what is absent is left out of it.
+// What the journal daemon adds to an entry. What is absent does not appear in the entry.
 struct RecordOrigin {
   uint64_t realtime = 0;   // microseconds since 1970
   uint64_t monotonic = 0;  // microseconds since boot
@@ -35,19 +35,19 @@ struct RecordOrigin {
 // The calling process, now.
 RecordOrigin currentOrigin();
 
-// The entry with its address and origin in the format, the empty line at its end included.
+// The entry in the Journal Export Format, with its empty line.
 std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
                        const std::vector<RecordedField>& fields);
 
-// Appends one entry to `<directory>/tessel.export`, making both where they are not there, or to
-// `directory` itself where it names an `.export` file. An error names the path and the reason, and
-// nothing was appended.
+// Appends one entry to `<directory>/tessel.export` and makes both if they do not exist; or to
+// `directory` itself if it names an `.export` file. After an error, which names the path and the
+// reason, nothing was appended.
 std::optional<PlatformError> appendToExportFile(const std::string& directory,
                                                 const RecordOrigin& origin,
                                                 const std::vector<RecordedField>& fields);
 
-// Hands one entry to the daemon. An error says why it could not be handed over, a daemon that is
-// not there included, which the system's own library does not tell.
+// Hands one entry to the journal daemon of this machine. No daemon is an error too, although the
+// system's own library takes it for success.
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields);
 
 }  // namespace tessel

@@ -1,7 +1,11 @@
+// Two steps in turns: follow sizes from object to object, and find the next object after damage.
+
 #include "journal/EntrySearch.h"
 
 #include <algorithm>
 #include <array>
+
+#include "platform/Invariant.h"
 
 namespace tessel {
 
@@ -10,6 +14,7 @@ using namespace journal_format;
 EntrySearch::EntrySearch(JournalFile& file, uint64_t start, uint64_t end, const StopFlag& stop)
     : file_(file), stop_(stop), start_(start), end_(end), position_(start) {}
 
+// Behind header().lastObject a file that is being written holds objects that are not finished.
 bool EntrySearch::mayHoldObject(uint64_t offset) const {
   const uint64_t end = searchEnd();
   return offset <= file_.header().lastObject && offset < end && end - offset >= kObjectHeaderSize;
@@ -17,13 +22,16 @@ bool EntrySearch::mayHoldObject(uint64_t offset) const {
 
 std::optional<ObjectHeader> EntrySearch::objectAt(uint64_t offset) {
   if (!mayHoldObject(offset)) return std::nullopt;
-  const uint64_t room = searchEnd() - offset;  // reading may find the file cut off before it
+  // Computed first: reading may find that the file was cut before `offset`, and then this
+  // difference would be negative.
+  const uint64_t room = searchEnd() - offset;
   const uint8_t* at = file_.file().at(offset, kObjectHeaderSize);
   if (at == nullptr) return std::nullopt;
   return file_.objectHeader({at, kObjectHeaderSize}, room);
 }
 
-// The same without moving the window, for a place that a damaged size may have made up.
+// A damaged size may point anywhere. Moving the window there and back for each candidate would read
+// the window's size again and again, so this reads sixteen bytes without it.
 bool EntrySearch::objectBeginsAt(uint64_t offset) {
   if (!mayHoldObject(offset)) return false;
   std::array<uint8_t, kObjectHeaderSize> bytes;
@@ -44,6 +52,8 @@ std::optional<uint64_t> EntrySearch::next() {
       continue;
     }
     position_ = alignUp(offset + object->size);
+    // Each entry is found once because the search only moves forward over objects that it accepted.
+    TESSEL_INVARIANT(position_ > offset && (!lastObject_ || offset > *lastObject_));
     lastObject_ = offset;
     if (object->type != kEntry) continue;
     EntryHeader entry;
@@ -57,8 +67,8 @@ void EntrySearch::noteDamage(uint64_t offset) {
   if (damagedPlaces_++ == 0) firstDamage_ = offset;
 }
 
-// Finds the next object where none is at `offset`. It may lie before: then the size of the last
-// object was wrong.
+// Finds the next object if there is none at `offset`. It may lie before `offset`: then the size of
+// the last object was wrong. False if only zeros are left, which is how an unused end looks.
 bool EntrySearch::resynchronise(uint64_t offset) {
   if (offset >= onlyZerosFrom()) return false;
   noteDamage(offset);
@@ -73,7 +83,7 @@ bool EntrySearch::resynchronise(uint64_t offset) {
   return false;
 }
 
-// Whether objects begin at `offset` and where that one ends.
+// Whether an object begins at `offset` and whether it is followed by what may follow an object.
 bool EntrySearch::makesSense(uint64_t offset) {
   const auto object = objectAt(offset);
   if (!object) return false;
@@ -83,7 +93,8 @@ bool EntrySearch::makesSense(uint64_t offset) {
 
 uint64_t EntrySearch::searchEnd() const { return std::min(end_, file_.objectsEnd()); }
 
-// Where nothing but zeros is left of the stretch.
+// Where the zeros begin that reach to the end of the part. Following the size of each candidate
+// through the zeros behind it would take the square of the file's size, so this is found once.
 uint64_t EntrySearch::onlyZerosFrom() {
   if (onlyZerosFrom_) return *onlyZerosFrom_;
   uint64_t from = start_;
@@ -99,7 +110,7 @@ uint64_t EntrySearch::onlyZerosFrom() {
   return *(onlyZerosFrom_ = from);
 }
 
-// The eight-byte words from `offset` on that one window holds; nothing at the end, or soon after
+// The eight-byte words from `offset` on that the window holds. Nothing at the end, or soon after
 // the stop flag was set.
 std::optional<std::span<const uint8_t>> EntrySearch::wordsAt(uint64_t offset) {
   const uint64_t end = searchEnd();
@@ -111,7 +122,7 @@ std::optional<std::span<const uint8_t>> EntrySearch::wordsAt(uint64_t offset) {
                      ~size_t{7});
 }
 
-// The first of the eight-byte words from `offset` on that is not all zeros.
+// The offset of the next eight-byte word that is not zero: an object's first word holds its type.
 std::optional<uint64_t> EntrySearch::nextNonZero(uint64_t offset) {
   while (const auto words = wordsAt(offset)) {
     for (size_t at = 0; at < words->size(); at += 8)

@@ -1,12 +1,19 @@
-// EntrySearch: finds the entries of a stretch of a journal file object by object, without the chain
-// that lists them.
+// EntrySearch: finds entries in a part of a journal file object by object, without the list of
+// entries.
 //
-// Where an object is not what the format allows, the search goes back to just behind the last one
-// that was and tries every eighth byte from there on, until two objects in a row make sense. It
-// never goes over the same stretch twice, whatever the file holds, so its time is bounded by the
-// file's size.
+// The reader uses it where an entry array is damaged. It steps from object to object by their
+// sizes. If there is no valid object where one should begin, the size of the last object may have
+// been wrong. The search then goes back to just behind the header of that object and tries every
+// eighth byte, because objects begin at multiples of eight. Random bytes often look like an object,
+// so a place counts only if the object there is followed by another one, by zeros up to the end, or
+// by the end of what was written. Asking for three objects in a row would find less behind damage;
+// asking for one finds entries that never were.
 //
-// Threads: one at a time, but for the stop flag.
+// It guarantees: entries come in rising order, each once; and the time is proportional to the size
+// of the part, whatever the file holds, because it never goes back behind an object that it
+// accepted and looks for the zeros at the end only once.
+//
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -20,13 +27,13 @@ namespace tessel {
 
 class EntrySearch {
  public:
-  // Searches from `start`, where an object should begin, up to `end`, where one should end.
+  // Searches from `start`, where an object should begin, to `end`, where one should end.
   // `file` and `stop` must outlive the search.
   EntrySearch(JournalFile& file, uint64_t start, uint64_t end, const StopFlag& stop);
 
-  // The offset of the next entry; nothing at the end, or soon after the stop flag was set.
+  // The offset of the next entry. Nothing at the end, or soon after the stop flag was set.
   std::optional<uint64_t> next();
-  // Places where objects made no sense, and the first of them.
+  // How often no valid object was where one should be, and the first offset where that happened.
   uint64_t damagedPlaces() const { return damagedPlaces_; }
   uint64_t firstDamage() const { return firstDamage_; }
 

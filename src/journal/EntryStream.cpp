@@ -1,3 +1,5 @@
+// Cursors and ids as text.
+
 #include "journal/EntryStream.h"
 
 #include <charconv>
@@ -63,7 +65,7 @@ std::optional<Id128> parseId128(std::string_view text) {
   Id128 id{};
   size_t digits = 0;
   for (const char c : text) {
-    if (c == '-' && text.size() == 36) continue;
+    if (c == '-' && text.size() == 36) continue;  // the kernel writes boot ids with dashes
     const int digit = digitOf(c);
     if (digit < 0 || digits == 2 * id.size()) return std::nullopt;
     id[digits / 2] = static_cast<uint8_t>(id[digits / 2] * 16 + digit);
@@ -79,6 +81,8 @@ std::string cursorOf(const EntryHeader& header) {
          ";t=" + hexadecimal(header.realtime) + ";x=" + hexadecimal(header.contentHash);
 }
 
+// The parts must come in journalctl's order, each once. A looser reader would accept text of log
+// values that only looks like a cursor, and the recorder would continue a wrong sequence.
 std::optional<EntryHeader> parseCursor(std::string_view cursor) {
   constexpr std::string_view kParts = "sibmtx";
   EntryHeader header;

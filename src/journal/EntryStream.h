@@ -1,13 +1,11 @@
-// EntryStream: the entries of a journal store, one after another, their fields as small integers.
+// EntryStream: journal entries, one after another, with their fields as small integers.
 //
-// A store keeps each distinct FIELD=value once and an entry refers to it. So the reader shows each
-// distinct value once to a FieldTokenizer, which parses and interns it and answers with a token;
-// an entry then is a header and a list of tokens. Fields of no interest have token 0 and are left
-// out of the list.
+// A journal stores each distinct FIELD=value once, and entries refer to it. We use this: a reader
+// shows each distinct text once to a FieldTokenizer, which parses it and returns a token. From then
+// on the reader only compares and copies integers; an entry is a header and a list of tokens.
+// Fields of no interest have the token kNoToken and do not appear in the list.
 //
-// Threads: one at a time, but for StopFlag.
-//
-// The cursor of an entry: its place in text form, as `journalctl --cursor=` takes it.
+// Threads: one at a time, except for StopFlag.
 
 #pragma once
 
@@ -25,11 +23,12 @@ namespace tessel {
 
 using FieldToken = uint32_t;
 inline constexpr FieldToken kNoToken = 0;
-// Tokens from here on belong to the store itself; a tokenizer stays below.
+// LossTokenizer uses tokens from here on; the tokenizer of a store's user stays below.
 inline constexpr FieldToken kFirstReservedToken = 0x80000000;
 
 using Id128 = std::array<uint8_t, 16>;
 
+// Two words are compared faster than sixteen bytes, and the merge compares ids for every entry.
 inline bool sameId(const Id128& a, const Id128& b) {
   uint64_t left[2];
   uint64_t right[2];
@@ -38,16 +37,18 @@ inline bool sameId(const Id128& a, const Id128& b) {
   return left[0] == right[0] && left[1] == right[1];
 }
 
-// Longest name of a field and longest value that a tokenizer is shown in full.
+// Bytes. The journal takes no longer names, so a text without '=' in its first 65 bytes is damaged.
 inline constexpr size_t kMaxFieldNameLength = 64;
+// Bytes. The longest value that a tokenizer is shown whole; of longer ones it sees the beginning.
 inline constexpr size_t kMaxFieldValueLength = 4096;
+// Name, '=', value, and one byte more that tells a value that was cut.
 inline constexpr size_t kMaxFieldHead = kMaxFieldNameLength + 1 + kMaxFieldValueLength + 1;
 
-// A field that makes an entry worth showing. Companions are fields that make it so as well, and
-// that nearly always stand in the same entries.
+// A field that makes an entry worth showing. Its companions do so too, but they nearly always stand
+// in the same entries as the field. A reader that has checked this follows the field alone.
 struct EntryMark {
   std::string_view field;
-  std::string_view value = {};  // the one that counts; empty: any does
+  std::string_view value = {};  // only this value counts; empty: any value does
   std::vector<std::string_view> companions = {};
 };
 
@@ -55,31 +56,31 @@ struct EntryMark {
 class FieldTokenizer {
  public:
   virtual ~FieldTokenizer() = default;
-  // What makes an entry worth showing; where there is nothing, every entry is. A reader that knows
-  // which entries carry a mark may deliver the others without tokens.
+  // What makes an entry worth showing; empty: every entry is. A reader that knows from the file's
+  // index which entries have a mark may deliver the others without tokens.
   virtual std::vector<EntryMark> marks() const { return {}; }
-  // Whether a field of this name can ever have a token; asked before a value is decompressed.
+  // Whether a field of this name can ever have a token. Asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
-  // The token of one FIELD=value; kNoToken for a field that is not wanted. `value` is the value's
-  // beginning, at least kMaxFieldValueLength + 1 bytes where there are so many; `size` its whole
-  // length in bytes, as far as known: where `value` is only the beginning, it may be any number
-  // greater than value.size(). The same text may be shown more than once.
+  // The token of one FIELD=value; kNoToken if the field is not wanted. `value` is the whole value,
+  // or its first kMaxFieldValueLength + 1 bytes or more. `size` is the length of the whole value in
+  // bytes if it is known; otherwise it is any number greater than value.size(). The same text may
+  // be shown more than once.
   virtual FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) = 0;
-  // Changes when all tokens handed out so far become void, because the tokenizer was emptied to
-  // stay within its memory. A reader compares it before it collects the tokens of an entry, and
-  // where it changed drops all tokens that it remembers. It changes only between two entries: from
-  // the call of EntryStream::entry() until its user is done with the tokens, every token is good.
+  // Changes when the tokenizer forgets all its texts to stay within its memory. All tokens that it
+  // returned before are then void. A reader compares it before it collects the tokens of an entry
+  // and shows the texts again if it changed. It changes only between two entries: from the call of
+  // EntryStream::entry() until its user is done with the tokens, every token is good.
   virtual uint32_t generation() const = 0;
 };
 
-// Where an entry stands in time and in the journal's own order.
+// When an entry was written, and its place in the journal's order.
 struct EntryHeader {
-  Id128 sequenceId{};  // which sequence `sequenceNumber` counts in; all zero: unknown
+  Id128 sequenceId{};  // the sequence that `sequenceNumber` counts in; all zero: unknown
   uint64_t sequenceNumber = 0;
   Id128 bootId{};
   uint64_t monotonic = 0;    // microseconds since boot
   uint64_t realtime = 0;     // microseconds since 1970, UTC
-  uint64_t contentHash = 0;  // exclusive or of the hashes of its data; 0: unknown
+  uint64_t contentHash = 0;  // exclusive or of the hashes of its data objects; 0: unknown
 };
 
 // Valid until the next call of next().
@@ -88,28 +89,29 @@ struct Entry {
   std::span<const FieldToken> tokens;
 };
 
-// Set from any thread; readers look at it often enough to end within a few milliseconds.
+// Set from any thread. Readers look at it often enough to end within some 20 milliseconds.
 using StopFlag = std::atomic<bool>;
 
 class EntryStream {
  public:
   virtual ~EntryStream() = default;
-  // Moves to the next entry; false at the end, or soon after the stop flag was set.
+  // Moves to the next entry. False at the end, or soon after the stop flag was set.
   virtual bool next() = 0;
-  // REQUIRES: the last next() answered true. Peeking at the header costs nothing; the tokens are
-  // collected by entry().
+  // Both REQUIRE that the last next() returned true. header() costs nothing; entry() collects the
+  // tokens, so who only counts or skips an entry does not call it.
   virtual const EntryHeader& header() const = 0;
   virtual Entry entry() = 0;
 };
 
+// The cursor of an entry, its place as a text that `journalctl --cursor=` takes:
 // "s=<sequence id>;i=<number>;b=<boot id>;m=<monotonic>;t=<realtime>;x=<content hash>", in
 // hexadecimal.
 std::string cursorOf(const EntryHeader& header);
 
-// The header that a cursor names; nothing where a part is missing or no hexadecimal number.
+// The header that a cursor names; nothing if a part is missing or is no hexadecimal number.
 std::optional<EntryHeader> parseCursor(std::string_view cursor);
 
-// 32 hexadecimal digits, with or without the dashes of a UUID; nothing for any other text.
+// Reads 32 hexadecimal digits, with or without the dashes of a UUID; nothing for other texts.
 std::optional<Id128> parseId128(std::string_view text);
 std::string textOf(const Id128& id);
 

@@ -17,12 +17,13 @@
 
 #include "journal/EntryStream.h"
 #include "os/UniqueFd.h"
+#include "platform/Invariant.h"
 
 namespace tessel {
 
 namespace {
 
-// A line longer than this, beyond what is shown of one, is read in pieces.
+// Bytes. A longer line is read in pieces: the window does not grow for the part that nobody sees.
 constexpr size_t kLongLine = kMaxFieldHead;
 
 bool isFieldName(std::string_view name) {
@@ -76,6 +77,7 @@ bool ExportEntryStream::next() {
   return false;
 }
 
+// Each entry starts from nothing, so what a bad one left behind never becomes part of the next.
 void ExportEntryStream::startEntry() {
   header_ = {};
   hasRealtime_ = false;
@@ -88,8 +90,10 @@ size_t ExportEntryStream::keptBeyondUsual(size_t added) const {
   return memory - std::min(memory, kUsualEntry);
 }
 
-// Gives back what was kept; memory for a usual entry stays for the next.
+// Gives back what was kept. clear() keeps the memory of a string, so one large entry in each of
+// thousands of files would add up; only memory for a usual entry stays.
 void ExportEntryStream::dropKept() {
+  TESSEL_INVARIANT(resources_.bytesKept >= keptBeyondUsual(0));  // the streams' shares add up
   resources_.bytesKept -= keptBeyondUsual(0);
   kept_.clear();
   keptFields_.clear();
@@ -113,7 +117,8 @@ ExportEntryStream::Outcome ExportEntryStream::finishEntry() {
   return Outcome::skipped;
 }
 
-// Reads up to the next newline; false where there is none yet.
+// Reads up to the next newline; false if there is none yet. `searched` spares looking at the same
+// bytes again each time the window has grown.
 bool ExportEntryStream::readLine(Line& line) {
   for (size_t searched = 0; searched <= kLongLine; searched = window_.bytes().size()) {
     if (!window_.fill(searched + 1)) return false;
@@ -127,7 +132,7 @@ bool ExportEntryStream::readLine(Line& line) {
   return readLongLine(line);
 }
 
-// A line of any length: its beginning is set aside.
+// Reads a line of any length. Its beginning is copied first, because the window moves past it.
 bool ExportEntryStream::readLongLine(Line& line) {
   resources_.longHead = window_.bytes().substr(0, kMaxFieldHead);
   uint64_t size = 0;
@@ -157,6 +162,7 @@ ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view n
   const uint64_t lengthPlace = window_.place();
   if (!window_.fill(8)) return Outcome::ended;
   const uint64_t length = littleEndian(window_.bytes());
+  // Checked before the length is passed over: resynchronising then starts right here.
   if (length > kMaxValueLength) return bad("value longer than any");
   window_.consume(8);
   const auto shown = static_cast<size_t>(std::min<uint64_t>(length, kMaxFieldValueLength + 1));
@@ -172,8 +178,9 @@ ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view n
   return takeField(nameLength, head, nameLength + 1 + length);
 }
 
-// Where a length is wrong, the empty line to go on after may lie within it. A file of nothing but
-// wrong lengths must still be read in time of its size.
+// After a wrong length the next empty line may lie within what was passed over, so we go back. All
+// ways back together are bounded by a multiple of what was read; otherwise a file of nothing but
+// wrong lengths would take the square of its size.
 void ExportEntryStream::goBackWithin(uint64_t place) {
   constexpr uint64_t kTimesOver = 8;
   const uint64_t distance = window_.place() - place;
@@ -205,13 +212,16 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   return Outcome::complete;
 }
 
-// Fields that say where an entry stands. The cursor comes first in a file, the others have the
-// last word.
+// Takes a field that says when the entry was written and where it stands. The cursor says all of
+// this, but writers that have only some of it leave the cursor out. It comes first in an entry, so
+// the other fields overwrite what it says.
 ExportEntryStream::Outcome ExportEntryStream::takeAddress(std::string_view name,
                                                           std::string_view value) {
   if (name == "__CURSOR") {
     if (const auto place = parseCursor(value)) header_ = *place;
   } else if (name == "__REALTIME_TIMESTAMP") {
+    // A second time means that the empty line between two entries was lost. Reading on would make
+    // one entry of both.
     if (hasRealtime_) return bad("two entries without an empty line between");
     if (!parseUnsigned(value, header_.realtime)) return bad("invalid __REALTIME_TIMESTAMP");
     hasRealtime_ = true;
@@ -231,7 +241,7 @@ ExportEntryStream::Outcome ExportEntryStream::bad(std::string_view reason) {
   return Outcome::bad;
 }
 
-// Passes over what is left up to the next empty line; false where it is not there yet.
+// Passes over everything up to the next empty line; false if it is not there yet.
 bool ExportEntryStream::resynchronise() {
   for (Line line; readLine(line);) {
     if (line.size == 0) {
@@ -242,7 +252,8 @@ bool ExportEntryStream::resynchronise() {
   return false;
 }
 
-// What is there of the last entry is looked at again by the next call, as far as one can go back.
+// Goes back to the beginning of an entry that is not complete, so that the next call reads it
+// again. It is counted once, however often the next call finds it still incomplete.
 void ExportEntryStream::waitAtEntry() {
   if (!window_.error().empty()) report_.addProblem("read error: " + window_.error(), entryPlace_);
   const bool stopped = stop_.load(std::memory_order_relaxed);
@@ -265,6 +276,8 @@ Entry ExportEntryStream::entry() {
 
 namespace {
 
+// journalctl prints a million entries in some eight seconds of processor time and 300 MB of memory.
+// A child that needs much more is busy with damage.
 constexpr rlim_t kProcessorSeconds = 120;
 constexpr rlim_t kMemory = rlim_t{1} << 30;
 
@@ -273,7 +286,7 @@ void limit(pid_t child, __rlimit_resource resource, rlim_t value) {
   ::prlimit(child, resource, &both, nullptr);
 }
 
-// Waits for `child`; whether it ended well.
+// Waits for `child`. Returns whether it exited with status 0.
 bool endedWell(pid_t child) {
   int status = 0;
   while (::waitpid(child, &status, 0) < 0)
@@ -281,7 +294,8 @@ bool endedWell(pid_t child) {
   return WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
 
-// Starts journalctl with its output going to `output`; 0 where it cannot be started.
+// Starts journalctl with `output` as its standard output; 0 if it cannot be started. A spawn
+// instead of a fork, because other threads may hold locks that a forked child would wait for.
 pid_t startJournalctl(const std::string& path, int output) {
   std::string file = "--file=" + path;
   std::array<std::string, 5> words = {"journalctl", "--output=export", "--all", "--quiet", file};
@@ -310,6 +324,7 @@ std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
   const UniqueFd output(ends[1]);
   const pid_t child = startJournalctl(path, output.get());
   if (child == 0) return nullptr;
+  // Set from outside: the child cannot have read much yet, and spawn has no way to set them before.
   limit(child, RLIMIT_CPU, kProcessorSeconds);
   limit(child, RLIMIT_AS, kMemory);
   return std::unique_ptr<ForeignJournalStream>(new ForeignJournalStream(
@@ -329,7 +344,8 @@ bool ForeignJournalStream::next() {
   }
   if (child_ == 0 || stop_.load(std::memory_order_relaxed)) return false;
   if (!endedWell(std::exchange(child_, 0))) report_.addProblem("journalctl failed", 0);
-  // For a layout that it does not know either, it ends well and prints nothing.
+  // If journalctl does not know the layout either, it prints nothing and still exits with 0. The
+  // header's count then tells what was not read.
   if (missing_ != 0) report_.addProblem("entries that journalctl did not read", 0, missing_);
   return false;
 }

@@ -1,20 +1,19 @@
-// ExportEntryStream: the entries of a file or pipe in the Journal Export Format.
+// Entries in the Journal Export Format, from a file or a pipe.
 //
-// An entry is a block of lines NAME=value, or NAME, eight bytes of length, the value and a newline
-// for a value of any bytes; an empty line ends it. The input is not trusted: what does not fit is
-// counted in the report with its place, and reading goes on after the next empty line.
+// An entry is a row of lines and ends with an empty line. A line is NAME=value. If the value has
+// bytes that a line cannot hold, it is NAME, a newline, the length of the value as eight bytes, the
+// value, and a newline. Nothing is believed: an entry that breaks these rules is counted in the
+// report with its place, and reading goes on after the next empty line.
 //
-// Other processes may append meanwhile. An entry whose empty line is not there yet is no entry;
-// next() looks at it again, so a stream that has ended may go on when it is asked later.
+// Other processes may append meanwhile. An entry without its empty line is not complete yet, so a
+// stream that has ended reads it again at the next call of next(), and may then go on.
 //
-// Threads: one at a time, but for the stop flag.
+// ForeignJournalStream has journalctl print a journal file of a layout that we do not know, and
+// reads that. journalctl runs as a child with limits on its time and memory, so a damaged file can
+// kill the child but not us. We do not read all files like this: it costs some sixty times as much
+// as our reader, because it prints every field.
 //
-// ForeignJournalStream: a journal file of a layout that we do not know, read by journalctl.
-//
-// It runs as a child with limits on its time and its memory, so what a damaged file does to it does
-// not happen to us. What it prints is read as an export stream.
-//
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -30,28 +29,30 @@
 
 namespace tessel {
 
-// What the export streams of one store share, to stay within a fixed amount of memory.
+// What all export streams of a store share, so that memory does not grow with their number.
 struct ExportReadResources {
   WindowBudget& windows;
-  size_t bytesKept = 0;              // of the current entries of all streams, beyond what is usual
-  std::string longHead{};            // of a line that is read in pieces
-  std::vector<FieldToken> tokens{};  // of the entry that is looked at
+  size_t bytesKept = 0;              // what all streams keep beyond kUsualEntry each
+  std::string longHead{};            // the beginning of a line that is read in pieces
+  std::vector<FieldToken> tokens{};  // of the current entry
 };
 
 class ExportEntryStream final : public EntryStream {
  public:
-  // Largest value that is believed.
+  // Bytes. The journal's own tools refuse longer values, so a greater length is damage. We would
+  // have to read over it before we know.
   static constexpr uint64_t kMaxValueLength = 768ull * 1024 * 1024;
-  // Most that is kept of one entry, of the fields that the tokenizer wants.
+  // What is kept of one entry at most: fields and bytes that the tokenizer wants.
   static constexpr size_t kMaxFieldsKept = 1024;
   static constexpr size_t kMaxBytesKept = size_t{1024} * 1024;
-  // What any stream may keep of an entry, and the most that all may keep beyond, both with the
-  // bookkeeping.
+  // Bytes, bookkeeping included. A merge holds one entry of each stream. Every stream may keep
+  // kUsualEntry, or entries would be refused only because there are thousands of files; beyond that
+  // all of them share kMaxBytesKeptByAll.
   static constexpr size_t kUsualEntry = 1024;
   static constexpr size_t kMaxBytesKeptByAll = 4 * kMaxBytesKept;
 
-  // Takes the descriptor and closes it. Problems are added to `report`; its entries are not
-  // counted. Whatever is passed by reference must outlive the stream.
+  // Owns the descriptor. Adds problems to `report`, but does not count entries there. Everything
+  // that is passed by reference must outlive the stream.
   ExportEntryStream(int fd, ExportReadResources& resources, FieldTokenizer& tokenizer,
                     const StopFlag& stop, FileReport& report);
   ~ExportEntryStream() override { dropKept(); }
@@ -63,14 +64,14 @@ class ExportEntryStream final : public EntryStream {
  private:
   enum class Outcome { complete, skipped, bad, ended };
   struct Line {
-    std::string_view head;  // up to kMaxFieldHead bytes
-    uint64_t size = 0;      // of the whole line without its newline
+    std::string_view head;  // the first kMaxFieldHead bytes
+    uint64_t size = 0;      // bytes of the whole line, without the newline
   };
   struct KeptField {
     uint32_t offset;
     uint32_t nameLength;
-    uint32_t length;  // of what is kept, name and all
-    uint32_t size;    // of the whole value
+    uint32_t length;  // of what is kept: name, '=' and the head of the value
+    uint32_t size;    // of the whole value; UINT32_MAX: that or more
   };
 
   void startEntry();
@@ -99,21 +100,22 @@ class ExportEntryStream final : public EntryStream {
   bool hasRealtime_ = false;
   bool resynchronising_ = false;
   uint64_t entryPlace_ = 0;
-  uint64_t incompletePlace_ = ~uint64_t{0};  // where an incomplete entry was counted
-  uint64_t wentBack_ = 0;                    // bytes, for wrong lengths
-  std::string kept_;                         // heads of the wanted fields of the entry
+  uint64_t incompletePlace_ = ~uint64_t{0};  // of the incomplete entry that was counted last
+  uint64_t wentBack_ = 0;                    // bytes that were read again after wrong lengths
+  std::string kept_;                         // the kept parts of all wanted fields
   std::vector<KeptField> keptFields_;
 };
 
+// A journal file of a layout that we do not know, read by journalctl.
 class ForeignJournalStream final : public EntryStream {
  public:
-  // Starts journalctl on the file at `path`, which should hold `entryCount` entries; null where it
-  // cannot be started. Problems are added to `report`.
+  // Starts journalctl on the file at `path`, which should hold `entryCount` entries. Null if it
+  // cannot be started. Adds problems to `report`.
   static std::unique_ptr<ForeignJournalStream> start(const std::string& path, uint64_t entryCount,
                                                      ExportReadResources& resources,
                                                      FieldTokenizer& tokenizer,
                                                      const StopFlag& stop, FileReport& report);
-  // Ends the child where it still runs.
+  // Kills the child if it still runs, and waits for it.
   ~ForeignJournalStream() override;
 
   bool next() override;
@@ -129,8 +131,8 @@ class ForeignJournalStream final : public EntryStream {
         report_(report),
         entries_(output, resources, tokenizer, stop, report) {}
 
-  pid_t child_;       // 0 once it was waited for
-  uint64_t missing_;  // entries that the file should hold and that were not read yet
+  pid_t child_;       // 0: it has ended and was waited for
+  uint64_t missing_;  // entries that the file should hold and that did not come yet
   const StopFlag& stop_;
   FileReport& report_;
   ExportEntryStream entries_;

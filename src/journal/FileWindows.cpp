@@ -1,3 +1,5 @@
+// Windows over files that others may cut or extend meanwhile.
+
 #include "journal/FileWindows.h"
 
 #include <poll.h>
@@ -7,14 +9,20 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <system_error>
 #include <utility>
+
+#include "os/Files.h"
 
 namespace tessel {
 
 namespace {
+// Of many files only the first entry is looked at before the merge gets to them. One page is enough
+// for that.
 constexpr size_t kFirstWindow = size_t{4} << 10;
 constexpr uint64_t kPage = 4096;
+// A stop must take effect within a few tens of milliseconds, and waking fifty times a second costs
+// nothing that shows.
+constexpr int kStopLatencyMilliseconds = 20;
 }  // namespace
 
 WindowedFile::WindowedFile(UniqueFd fd, uint64_t size, WindowBudget& budget)
@@ -30,9 +38,12 @@ const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
   const size_t capacity = std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share());
   const uint64_t end = offset + size;
   uint64_t start = std::min(from, offset);
-  // Half of the window is kept for what comes next.
+  // The caller reads on from `offset`. So the bytes before it take at most half of the window;
+  // otherwise a large distance from `from` would leave no room, and each entry would move it.
   if (end - start > capacity / 2)
     start = std::max(start, offset - std::min<uint64_t>(offset, capacity / 2));
+  // A large window begins at a page, because the kernel copies whole pages faster. In a small one
+  // that would waste up to a page; objects begin at multiples of eight.
   start -= start % (capacity >= 8 * kPage ? kPage : 8);
   moveWindow(start, static_cast<size_t>(end - start));
   return inWindow(offset, size);
@@ -42,7 +53,7 @@ void WindowedFile::moveWindow(uint64_t start, size_t least) {
   const size_t wanted =
       std::max(least, std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share()));
   if (wanted != windowCapacity_) {
-    window_.reset();
+    window_.reset();  // before the new one is taken, so that there are never two
     window_ = std::make_unique_for_overwrite<uint8_t[]>(wanted);
     windowCapacity_ = wanted;
   }
@@ -50,16 +61,20 @@ void WindowedFile::moveWindow(uint64_t start, size_t least) {
   windowLength_ = 0;
   const size_t length = static_cast<size_t>(std::min<uint64_t>(wanted, size_ - start));
   windowLength_ = read(start, {window_.get(), length});
+  // Larger than the share only for one object that is larger. This bounds the memory of a run.
+  TESSEL_INVARIANT(windowLength_ <= windowCapacity_ &&
+                   windowCapacity_ <= std::max(least, budget_.share()));
 }
 
 std::span<const uint8_t> WindowedFile::restOfWindow(uint64_t offset) const {
-  if (offset < windowStart_ || offset - windowStart_ > windowLength_) return {};
-  const size_t skipped = static_cast<size_t>(offset - windowStart_);
-  return {window_.get() + skipped, windowLength_ - skipped};
+  const uint8_t* bytes = inWindow(offset, 0);
+  if (bytes == nullptr) return {};
+  return {bytes, windowLength_ - static_cast<size_t>(offset - windowStart_)};
 }
 
 uint64_t WindowedFile::nextWritten(uint64_t offset) const {
   const off_t found = ::lseek(fd_.get(), static_cast<off_t>(offset), SEEK_DATA);
+  // ENXIO: nothing but a hole is left. Other errors mean that the file system knows no holes.
   if (found < 0) return errno == ENXIO ? size_ : offset;
   return std::max(offset, static_cast<uint64_t>(found) & ~uint64_t{7});
 }
@@ -71,7 +86,8 @@ size_t WindowedFile::read(uint64_t offset, std::span<uint8_t> target) {
                                 static_cast<off_t>(offset + done));
     if (got < 0 && errno == EINTR) continue;
     if (got <= 0) {
-      // Within what the file held when it was opened: it was cut short, or it cannot be read.
+      // These bytes were there when the file was opened. Either it was cut, or it cannot be read.
+      // From now on the smaller size bounds all offsets, so that we do not ask again and again.
       if (offset + done < size_) {
         failed_ = true;
         struct stat status {};
@@ -84,12 +100,6 @@ size_t WindowedFile::read(uint64_t offset, std::span<uint8_t> target) {
   }
   return done;
 }
-
-namespace {
-
-constexpr int kStopLatencyMilliseconds = 20;
-
-}  // namespace
 
 ByteWindow::ByteWindow(int fd, const StopFlag& stop, WindowBudget& budget)
     : fd_(fd), stop_(stop), budget_(budget) {
@@ -113,8 +123,8 @@ bool ByteWindow::fill(size_t count) {
   return true;
 }
 
-// Brings what is held to the front of a buffer for `count` bytes, more than are held. A buffer that
-// had to be larger than its share is given back here.
+// Moves the bytes that are held to the front of a buffer for `count` bytes. A buffer that is larger
+// than the share, because of one long value, shrinks here again.
 void ByteWindow::makeRoom(size_t count) {
   const size_t wanted = std::max(count, budget_.share());
   if (begin_ + count <= capacity_ && capacity_ <= wanted) return;
@@ -141,12 +151,13 @@ bool ByteWindow::readMore() {
     }
     if (got == 0) return false;
     if (errno == EINTR || errno == EAGAIN) continue;
-    error_ = std::generic_category().message(errno);
+    error_ = errorWords(errno);
     return false;
   }
 }
 
 bool ByteWindow::waitForInput() {
+  // read() alone would sleep in the kernel, where the stop flag cannot wake it.
   while (!stop_.load(std::memory_order_relaxed)) {
     pollfd waited{fd_, POLLIN, 0};
     if (::poll(&waited, 1, kStopLatencyMilliseconds) != 0) return true;
@@ -155,6 +166,7 @@ bool ByteWindow::waitForInput() {
 }
 
 void ByteWindow::consume(size_t count) {
+  TESSEL_INVARIANT(count <= end_ - begin_);  // the place must stay within what was read
   begin_ += count;
   place_ += count;
   if (begin_ == end_) begin_ = end_ = 0;
@@ -171,6 +183,8 @@ bool ByteWindow::skip(uint64_t count) {
 }
 
 bool ByteWindow::rewind(uint64_t place) {
+  TESSEL_INVARIANT(place <= place_);
+  // Bytes before begin_ stay in the buffer until makeRoom() moves the rest over them.
   if (place_ - place <= begin_) {
     begin_ -= static_cast<size_t>(place_ - place);
     place_ = place;

@@ -1,18 +1,14 @@
-// WindowedFile: a file read with pread through a window that moves forward.
+// Windows: the small pieces of files that are in memory while we read them.
 //
-// No memory map, so a file that is cut short or fails under the reader costs a failed read and not
-// the process. The windows of all files that are read at once share one budget; a window starts
-// small and doubles while it is used, up to the share of its file.
+// WindowedFile reads a regular file at any offset; ByteWindow reads a file, pipe or socket forward.
+// Both copy with read and pread. A memory map would spare the copy, but the kernel kills a process
+// that touches a mapped page of a file that was cut meanwhile, and journals are cut while they are
+// read. Here such a file costs a failed read.
 //
-// Threads: one at a time.
+// A store can have thousands of files and reads all of them at once, because it merges them. So all
+// windows share one WindowBudget, and memory does not grow with the number of files.
 //
-// ByteWindow: a file, pipe or socket read forward through a window.
-//
-// Nothing is mapped, so a file that is truncated meanwhile just ends early. At the end of what is
-// there now, a later call sees what was added. The window takes its share of a budget, and more
-// only while it is asked for more at once.
-//
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -26,19 +22,29 @@
 
 #include "journal/EntryStream.h"
 #include "os/UniqueFd.h"
+#include "platform/Invariant.h"
 
 namespace tessel {
 
-// Shares a fixed amount of memory among the files that are read at once.
+// Divides a fixed amount of memory among the files that are read at once.
 class WindowBudget {
  public:
+  // The day of a usual machine has less than 96 files, and 12 MiB give each of them the largest
+  // window. 8,192 files, the most that a store takes, get 1.5 KiB each. All this stays small beside
+  // the 128 MB that a run of the service may take.
   static constexpr size_t kTotal = size_t{12} << 20;
+  // An entry and its usual data fit in this.
   static constexpr size_t kSmallest = size_t{1} << 10;
+  // One system call for so many bytes no longer shows in the time of a run, and the window still
+  // fits the processor's second-level cache beside the table of tokens.
   static constexpr size_t kLargest = size_t{128} << 10;
 
   void join() { ++readers_; }
-  void leave() { --readers_; }
-  // Bytes that the window of one file may take.
+  void leave() {
+    TESSEL_INVARIANT(readers_ > 0);  // otherwise the shares would no longer add up to kTotal
+    --readers_;
+  }
+  // Bytes that the window of one file may take now.
   size_t share() const {
     return std::clamp(kTotal / std::max<size_t>(readers_, 1), kSmallest, kLargest);
   }
@@ -47,6 +53,7 @@ class WindowBudget {
   size_t readers_ = 0;
 };
 
+// A regular file. Its window starts small and doubles each time it moves, up to the file's share.
 class WindowedFile {
  public:
   // `budget` must outlive the file.
@@ -55,29 +62,30 @@ class WindowedFile {
   WindowedFile(const WindowedFile&) = delete;
   WindowedFile& operator=(const WindowedFile&) = delete;
 
-  // Bytes that the file had when it was opened, less once a read found it shorter.
+  // Bytes: the size when the file was opened, or less after a read found the file shorter.
   uint64_t size() const { return size_; }
   // Bytes that the window may take.
   size_t share() const { return budget_.share(); }
-  // Whether a read failed or found the file shorter than it was.
+  // Whether a read failed or found the file shorter than it was. Stays true.
   bool failed() const { return failed_; }
 
-  // `size` bytes at `offset` by way of the window, which moves there if it must, keeping in view
-  // what lies behind `from`, as far as that fits; null where the file does not hold them. Valid
-  // until the next call of either at().
+  // Returns the `size` bytes at `offset`, or null if the file does not hold them. If they are not
+  // in the window, it moves, and then it begins at `from` if both fit: a caller that will look at
+  // bytes before `offset` names them here. Valid until the next call of at().
   const uint8_t* at(uint64_t offset, size_t size, uint64_t from);
   const uint8_t* at(uint64_t offset, size_t size) { return at(offset, size, offset); }
-  // The same, only where the bytes are in the window; the window stays.
+  // Returns the same without moving the window, or null if the bytes are not in it.
   const uint8_t* inWindow(uint64_t offset, size_t size) const {
     if (offset < windowStart_ || offset - windowStart_ > windowLength_) return nullptr;
     const size_t skipped = static_cast<size_t>(offset - windowStart_);
     return size <= windowLength_ - skipped ? window_.get() + skipped : nullptr;
   }
-  // Bytes of the window from `offset` on; empty where it is not in the window.
+  // Bytes of the window from `offset` on; empty if `offset` is not in the window.
   std::span<const uint8_t> restOfWindow(uint64_t offset) const;
-  // The first place from `offset` on that is not a hole of the file, rounded down to eight bytes.
+  // The first offset, `offset` or later, that is not in a hole of the file, rounded down to eight
+  // bytes. The search skips the holes of sparse files with this.
   uint64_t nextWritten(uint64_t offset) const;
-  // Reads beside the window. Returns the number of bytes read, fewer than asked for at the end.
+  // Reads without the window. Returns the number of bytes; fewer than asked for if the file ends.
   size_t read(uint64_t offset, std::span<uint8_t> target);
 
  private:
@@ -93,29 +101,31 @@ class WindowedFile {
   size_t windowLength_ = 0;
 };
 
+// A file, pipe or socket that is read forward. At the end it reads what was added since. The window
+// has its share of the budget; it is larger only while fill() is asked for more at once.
 class ByteWindow {
  public:
-  // Takes the descriptor and closes it. A wait for a pipe ends soon after `stop` is set. `budget`
-  // must outlive the window.
+  // Owns the descriptor. A wait for a pipe ends at most 20 ms after `stop` is set. `budget` and
+  // `stop` must outlive the window.
   ByteWindow(int fd, const StopFlag& stop, WindowBudget& budget);
   ~ByteWindow();
   ByteWindow(const ByteWindow&) = delete;
   ByteWindow& operator=(const ByteWindow&) = delete;
 
-  // Tries to have `count` bytes in the window; false where there are fewer.
+  // Reads until `count` bytes are in the window; false if there are fewer, or if reading failed.
   bool fill(size_t count);
-  // The bytes in the window; valid until the next call that is not const.
+  // The bytes in the window. Valid until the next call that is not const.
   std::string_view bytes() const { return {buffer_.get() + begin_, end_ - begin_}; }
   // REQUIRES: count <= bytes().size().
   void consume(size_t count);
-  // Passes over `count` bytes; false where there are fewer, and the place is then the end.
+  // Passes over `count` bytes; false if there are fewer, and then the place is at the end.
   bool skip(uint64_t count);
-  // Goes back to a place passed before; false where the descriptor cannot.
+  // Goes back to an earlier place; false if that left the window and the descriptor cannot seek.
   bool rewind(uint64_t place);
 
-  // Bytes from where reading began to the first in the window.
+  // How many bytes stand before the window, counted from where reading began.
   uint64_t place() const { return place_; }
-  // The last reading error, in words; empty where there was none.
+  // The last error of reading, in words; empty if there was none.
   const std::string& error() const { return error_; }
 
  private:
@@ -127,7 +137,7 @@ class ByteWindow {
   const StopFlag& stop_;
   WindowBudget& budget_;
   bool seekable_;
-  int64_t base_ = 0;  // offset in the file of place 0
+  int64_t base_ = 0;  // offset in the file where reading began
   std::unique_ptr<char[]> buffer_;
   size_t capacity_ = 0;
   size_t begin_ = 0;

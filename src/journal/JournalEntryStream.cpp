@@ -1,16 +1,19 @@
+// Three parts: where the next entry is, what is wrong with the file, and the tokens of an entry.
+
 #include "journal/JournalEntryStream.h"
 
 #include <algorithm>
 #include <string_view>
 #include <utility>
 
+#include "platform/Invariant.h"
+
 namespace tessel {
 
 using namespace journal_format;
 
 namespace {
-// Answered in place of a token where a data object is not what it should be. No token has this
-// value.
+// Returned instead of a token if a data object holds no FIELD=value. No token has this value.
 constexpr FieldToken kDamaged = UINT32_MAX;
 }  // namespace
 
@@ -31,7 +34,7 @@ bool JournalEntryStream::next() {
   while (!context_.stop.load(std::memory_order_relaxed)) {
     const uint64_t offset = search_ || pending_ != 0 ? nextFound() : nextListed();
     if (offset == 0) {
-      // An end that comes with the stop is none of the file's.
+      // After a stop the rest of the file is not missing, only unread.
       if (!context_.stop.load(std::memory_order_relaxed)) finish();
       return false;
     }
@@ -40,7 +43,8 @@ bool JournalEntryStream::next() {
   return false;
 }
 
-// Where the chain has the next entry. Where it has a gap before that, the search comes first.
+// The offset of the next entry by the chain. If the chain has a gap before it, the search in the
+// gap comes first.
 uint64_t JournalEntryStream::nextListed() {
   if (finished_) return 0;
   const uint64_t offset = chain_.next();
@@ -51,7 +55,8 @@ uint64_t JournalEntryStream::nextListed() {
   return nextFound();
 }
 
-// Where the search that is under way has the next entry, and then the chain.
+// The offset of the next entry while a gap is searched: what the search finds, then the listed
+// entry behind the gap, then the chain.
 uint64_t JournalEntryStream::nextFound() {
   if (search_) {
     if (const auto found = search_->next()) return *found;
@@ -61,8 +66,9 @@ uint64_t JournalEntryStream::nextFound() {
   return nextListed();
 }
 
-// Makes the entry at `offset` the current one; false where it is none, and then what lies around it
-// is searched, up to the next that the chain lists.
+// Makes the entry at `offset` the current one. False if there is no valid entry: if its offset or
+// its size is wrong, other entries may stand there, so the part up to the next listed one is
+// searched.
 bool JournalEntryStream::take(uint64_t offset) {
   const uint64_t size = file_.readEntry(offset, searchedTo_, entry_);
   if (size == 0) {
@@ -72,12 +78,14 @@ bool JournalEntryStream::take(uint64_t offset) {
     searchUpTo(next);
     return false;
   }
+  TESSEL_INVARIANT(offset > entryOffset_);  // so no entry is delivered twice
   entryOffset_ = offset;
   entrySize_ = size;
   firstFresh_ = searchedTo_;
   searchedTo_ = alignUp(offset + size);
   ++delivered_;
-  // What was added since the header was read may be in no list yet.
+  // Lists were read when the file was opened. An entry beyond the count was added since and may be
+  // in none of them.
   entryMarked_ = marked_ == nullptr || delivered_ > file_.header().entryCount || isMarked(offset);
   return true;
 }
@@ -90,10 +98,11 @@ bool JournalEntryStream::isMarked(uint64_t offset) {
   return true;
 }
 
-// Searches what lies before `listed`, the next entry of the chain; 0: the chain has ended.
+// Starts to search what lies before `listed`, the next entry of the chain; 0: up to the end.
 void JournalEntryStream::searchUpTo(uint64_t listed) {
   if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
-  marked_.reset();  // what is found may stand in no list
+  // Entries that are found may be in no list, and the caller would not ask about them in order.
+  marked_.reset();
   pending_ = listed;
   const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
   search_.emplace(file_, std::min(searchedTo_, end), end, context_.stop);
@@ -106,12 +115,14 @@ void JournalEntryStream::endSearch() {
   searchedTo_ = std::max(searchedTo_, pending_);
 }
 
+// Says once what the file should have had. A file may be asked again after its end.
 void JournalEntryStream::finish() {
   if (std::exchange(reported_, true)) return;
   const uint64_t expected = file_.header().entryCount;
   if (marked_ && marked_->awaitsMore() && delivered_ <= expected)
     context_.report.addProblem("list of entries damaged", file_.objectsEnd());
-  // The daemon cuts off what it has not used of a file when it closes it; that costs nothing.
+  // When the daemon closes a file it cuts off the end that it has not used. Nothing is lost then,
+  // so a failed read alone is no problem.
   if (file_.file().failed() && (expected > delivered_ || !context_.report.problems.empty()))
     context_.report.addProblem("cut short or not readable", file_.file().size());
   if (expected > delivered_)
@@ -124,7 +135,7 @@ Entry JournalEntryStream::entry() {
   return {entry_, std::span(context_.resources.tokens).first(count)};
 }
 
-// Answers how many there are.
+// Returns how many tokens the entry has.
 size_t JournalEntryStream::collectTokens() {
   const size_t all = file_.itemCount(entrySize_);
   const size_t count = std::min(all, JournalFile::kMaxItems);
@@ -139,6 +150,9 @@ size_t JournalEntryStream::collectTokens() {
                                   : tokensOf<uint64_t>(items, count);
 }
 
+// The innermost loop of the service: some 20 fields for each entry. A template for both layouts
+// keeps their difference out of it, and a kept token is written before it is known to be wanted,
+// which spares a branch that the processor cannot predict.
 template <typename Item>
 size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
@@ -159,8 +173,10 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   return static_cast<size_t>(kept - tokens);
 }
 
-// Looks at a data object. What only this entry refers to is not remembered, unless looking again
-// would be dear, nor is what is none: it may lie across one that is.
+// Reads a data object and shows it to the tokenizer. Not every token is remembered. An invalid
+// object is not: it may overlap a valid one and would have its key. Nor is a value that was written
+// for this entry and claims no other: nobody asks again, and it would push out a value that recurs.
+// A compressed one is remembered even so, in case the claim is wrong, because it is expensive.
 FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
   DataObject data;
   if (!file_.readData(offset, context_.resources.data, data)) {
@@ -186,7 +202,8 @@ FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head, uint64_t
                                      size - nameLength - 1);
 }
 
-// Decompresses the name first, and the value only where the name is wanted.
+// Decompresses the name first, and the value only if the name is wanted: most compressed values are
+// long messages, which nobody here wants.
 FieldToken JournalEntryStream::decompressToken(const DataObject& data) {
   const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> target) {
     const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);

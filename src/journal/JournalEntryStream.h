@@ -1,11 +1,14 @@
 // JournalEntryStream: the entries of one journal file, in the file's own order.
 //
-// The chain of entry arrays leads from entry to entry while a window moves forward over the file,
-// which shows nearly every data object just before the first entry that refers to it. Where the
-// chain is damaged, the stretch that it should cover is searched object by object. Offsets only
-// ever grow, so no entry is delivered twice.
+// The chain of entry arrays leads from entry to entry while the window moves forward over the file.
+// A writer puts a new data object directly before the first entry that refers to it, so the window
+// usually holds both. Older data objects were looked at before, and the token cache remembers them.
 //
-// Threads: one at a time, but for the stop flag.
+// If the chain or an entry is damaged, the part up to the next listed entry is searched object by
+// object. The offsets of delivered entries only grow, so none is delivered twice, even if it is
+// both found and listed.
+//
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -23,30 +26,31 @@
 
 namespace tessel {
 
-// What the readers of all files of a store share, to stay within a fixed amount of memory.
+// What the readers of all files of a store share, so that memory does not grow with their number.
+// Only one of them collects the tokens of an entry at a time, so one set of buffers is enough.
 struct JournalReadResources {
   WindowBudget windows;
   TokenCache tokenCache;
   Decompressor decompressor;
   std::array<uint8_t, JournalFile::kMaxDataRead> data;
   std::array<uint8_t, kMaxFieldHead> text;
-  std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the entry that is looked at
+  std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the current entry
   size_t entryListsLeft = MarkedEntries::kMaxListsOfStore;
 };
 
 class JournalEntryStream final : public EntryStream {
  public:
-  // What a stream works with; all of it must outlive the stream.
+  // What a stream works with. All of it must outlive the stream.
   struct Context {
     JournalReadResources& resources;
     FieldTokenizer& tokenizer;
-    std::span<const EntryMark> marks;  // of the tokenizer
+    std::span<const EntryMark> marks;  // the tokenizer's, made once for all files
     const StopFlag& stop;
     FileReport& report;
   };
 
-  // Reads the file of `fd`, of `size` bytes, whose header is `header`. `number` tells the files of
-  // one store apart and is below JournalStore::kMaxFiles.
+  // Reads the file of `fd`, which has `size` bytes and the header `header`. `number` is different
+  // for each file of a store and below JournalStore::kMaxFiles.
   JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header, uint32_t number,
                      const Context& context);
 
@@ -75,12 +79,12 @@ class JournalEntryStream final : public EntryStream {
   EntryChain chain_;
   std::unique_ptr<MarkedEntries> marked_;  // null: every entry may carry a mark
   std::optional<EntrySearch> search_;
-  uint64_t pending_ = 0;   // what the chain lists behind the stretch being searched; 0: nothing
+  uint64_t pending_ = 0;   // the listed entry behind the part that is searched; 0: none
   bool finished_ = false;  // the chain has ended
-  bool reported_ = false;  // what was missing is in the report
+  bool reported_ = false;  // finish() was done
   uint64_t delivered_ = 0;
-  uint64_t searchedTo_ = 0;  // before this, nothing is left to be found
-  uint64_t firstFresh_ = 0;  // data from here on is first referred to by the current entry
+  uint64_t searchedTo_ = 0;  // entries before this offset were delivered or are lost
+  uint64_t firstFresh_ = 0;  // data from here on was written for the current entry
   EntryHeader entry_;
   uint64_t entryOffset_ = 0;
   uint64_t entrySize_ = 0;

@@ -1,3 +1,5 @@
+// The checks of headers, entries and data objects.
+
 #include "journal/JournalFile.h"
 
 #include <sys/stat.h>
@@ -16,6 +18,7 @@ using namespace journal_format;
 
 namespace {
 
+// The size of an object that holds something: an empty data object or entry is damage.
 uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
   switch (type) {
     case kData:
@@ -39,8 +42,9 @@ Id128 loadId(const uint8_t* at) {
   return id;
 }
 
-// Where the objects end: with the arena, or with the file where the arena claims more or grows. A
-// header of a damaged size is followed by objects all the same.
+// Where the objects end: at the end of the arena, or at the end of the file if the arena still
+// grows or claims more than there is. If the size of the header itself is damaged, we assume the
+// shortest header: the search then finds the first object behind it.
 uint64_t endOfObjects(JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
   if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
       header.headerSize > std::min(fileSize, kMaxHeaderSize)) {
@@ -65,11 +69,12 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   header.sequenceId = loadId(at + kSequenceIdAt);
   header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
   header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
-  // While a file is written, what lies behind its last object is not yet an object.
+  // While a file is written, an object behind the last one may be half finished.
   const auto lastObject = load<uint64_t>(at + kTailObjectAt);
   const bool growing = header.beingWritten() && aligned(lastObject) &&
                        lastObject >= header.headerSize && lastObject < header.objectsEnd;
   header.lastObject = growing ? lastObject : UINT64_MAX;
+  // The count decides how many entries are reported missing, so a wild one must not get through.
   header.entryCount = std::min(load<uint64_t>(at + kEntryCountAt), fileSize / kEntryItemsAt);
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
@@ -82,7 +87,8 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   return header;
 }
 
-// The size is asked for last, so that it covers all that the header counts.
+// The daemon may append between the two calls. The size is asked for last, so that it covers
+// everything that the header counts.
 std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
   std::array<uint8_t, kHeaderRead> bytes;
   const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
@@ -107,7 +113,8 @@ std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> b
   const uint64_t first = load<uint64_t>(bytes.data());
   ObjectHeader object{static_cast<uint8_t>(first & 0xff), static_cast<uint8_t>(first >> 8 & 0xff),
                       load<uint64_t>(bytes.data() + kObjectSizeAt)};
-  // Six reserved bytes follow type and flags; only data has flags.
+  // The six bytes behind type and flags are zero, and only data objects have flags. These checks
+  // keep most garbage from being taken for an object.
   if (first >> 16 != 0 || object.type == kUnused || object.type > kTag) return std::nullopt;
   if (object.flags != 0 && (object.type != kData || (object.flags & ~kKnownDataFlags) != 0))
     return std::nullopt;
@@ -118,9 +125,10 @@ std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> b
 
 uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
   if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
-  const uint64_t room = objectsEnd() - offset;  // reading may find the file cut off before it
+  // Computed first: at() may find the file cut before `offset`, and objectsEnd() then moves.
+  const uint64_t room = objectsEnd() - offset;
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
-  // An entry has no flags.
+  // The first word is the type alone: an entry has no flags, and the reserved bytes are zero.
   if (at == nullptr || load<uint64_t>(at) != kEntry) return 0;
   const auto size = load<uint64_t>(at + kObjectSizeAt);
   if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
@@ -141,6 +149,7 @@ bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scr
   const uint64_t room = objectsEnd() - offset;
   const uint64_t wanted = std::min(room, dataHeaderSize_ + kMaxFieldHead);
   std::span<const uint8_t> bytes = file_.restOfWindow(offset);
+  // The window may end within the object. Its size is then unknown or too large for the window.
   if (bytes.size() < wanted && (bytes.size() < kObjectHeaderSize ||
                                 bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
     bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(wanted)})};
@@ -148,7 +157,7 @@ bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scr
   if (bytes.size() <= dataHeaderSize_) return false;
   const auto first = load<uint64_t>(bytes.data());
   data.compression = static_cast<uint8_t>(first >> 8);
-  // Type and flags, then six reserved bytes.
+  // The first word: type, flags, and six bytes that are zero.
   if ((first & ~(uint64_t{kKnownDataFlags} << 8)) != kData) return false;
   const auto size = load<uint64_t>(bytes.data() + kObjectSizeAt);
   const uint64_t shown = std::min(size, wanted);

@@ -1,8 +1,11 @@
-// JournalFile: one journal file, its header and its objects, nothing of it believed unchecked.
+// JournalFile: one journal file with its header and its objects.
 //
-// Every offset, size and type is held against the bounds of the real file and against what the
-// format allows before it is used. What fails is told as "not there"; the caller decides what that
-// costs.
+// Nothing in a file is believed. Any user can write entries, disks fail, and a daemon that is
+// killed leaves half an object. So before a value is used, it is checked: an offset against the
+// file's real size and the alignment, a size against the bytes that are left, a type, the reserved
+// bits, a time and a number against what a writer can produce. What fails a check is treated as if
+// it were not there, and the caller decides what that costs. Hashes are not checked: that would
+// read every payload again, and damage that keeps all links and sizes right only changes a text.
 //
 // Threads: one at a time.
 
@@ -21,16 +24,18 @@
 
 namespace tessel {
 
-// What the reader uses of a file's header, as it stood when it was read.
+// What the reader uses of a file's header. A file that is being written has moved on since.
 struct JournalHeader {
   uint32_t incompatibleFlags = 0;
   uint8_t state = 0;
   Id128 sequenceId{};
-  uint64_t headerSize = 0;  // where the objects begin
-  uint64_t objectsEnd = 0;  // where they end, at most the size of the file
-  uint64_t entryCount = 0;  // entries linked, by the header's word, at most what the file can hold
+  uint64_t headerSize = 0;  // bytes; the objects begin there
+  uint64_t objectsEnd = 0;  // the objects end there, at most at the end of the file
+  // How many entries the header claims, but not more than the file has room for.
+  uint64_t entryCount = 0;
   uint64_t entryArray = 0;  // offset of the first entry array; 0: none
-  uint64_t lastObject = 0;  // offset of the last object that counts; UINT64_MAX: all that are there
+  // Objects behind this offset may be unfinished. UINT64_MAX: the file is closed, all are finished.
+  uint64_t lastObject = 0;
   uint64_t headRealtime = 0;  // of the first and last entry written; 0: unknown
   uint64_t tailRealtime = 0;
   uint64_t fieldTable = 0;      // offset of the buckets of the hash table of fields; 0: unknown
@@ -44,7 +49,7 @@ struct JournalHeader {
   bool beingWritten() const { return state == journal_format::kOnline; }
 };
 
-// Parses the beginning of a file of `fileSize` bytes; the reason where it is no journal.
+// Parses the beginning of a file of `fileSize` bytes; the reason if it is no journal.
 std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint8_t> bytes,
                                                             uint64_t fileSize);
 
@@ -63,16 +68,17 @@ struct ObjectHeader {
 };
 
 struct DataObject {
-  uint8_t compression = 0;  // of journal_format::DataFlag
-  uint64_t entryCount = 0;  // entries that refer to it, by its own word
+  uint8_t compression = 0;  // a journal_format::DataFlag; 0: none
+  uint64_t entryCount = 0;  // how many entries it claims to be in
   uint64_t payloadOffset = 0;
   uint64_t payloadSize = 0;       // in the file, at least 1
-  std::span<const uint8_t> head;  // beginning of the payload; in the window or in scratch
+  std::span<const uint8_t> head;  // the beginning of the payload, in the window or in `scratch`
 };
 
 class JournalFile {
  public:
-  // Entries with more fields than this are read in part; the journal daemon takes 1,024.
+  // The journal daemon takes 1,024 fields in an entry and adds some of its own. Of an entry with
+  // more than twice as many we read the first ones, and say so.
   static constexpr size_t kMaxItems = 2048;
 
   JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header, WindowBudget& budget);
@@ -80,33 +86,34 @@ class JournalFile {
   const JournalHeader& header() const { return header_; }
   WindowedFile& file() { return file_; }
 
-  // Where objects end now: less than the header says once the file was found cut short.
+  // The end of the objects; moves to the front if a read finds the file shorter.
   uint64_t objectsEnd() const { return std::min(header_.objectsEnd, file_.size()); }
   // Whether an object of `least` bytes may begin at `offset`.
   bool mayHoldObject(uint64_t offset, uint64_t least) const {
     return journal_format::aligned(offset) && offset >= header_.headerSize &&
            offset < objectsEnd() && least <= objectsEnd() - offset;
   }
-  // The header of the object at the beginning of `bytes`, where it is one that the format allows
-  // and that ends within `room` bytes. REQUIRES: bytes.size() >= kObjectHeaderSize.
+  // The header of the object at the beginning of `bytes`; nothing if the format does not allow it
+  // or if it is longer than `room` bytes. REQUIRES: bytes.size() >= kObjectHeaderSize.
   std::optional<ObjectHeader> objectHeader(std::span<const uint8_t> bytes, uint64_t room) const;
 
-  // Fills `entry`, but for its sequence, which is the file's, from the entry object at `offset`,
-  // read by way of the window, which keeps what lies behind `from` in view. Answers the size of the
-  // object in bytes; 0 where there is none.
+  // Fills `entry` from the entry object at `offset`, but not its sequence id, which is the file's.
+  // The window may move, and then it begins at `from` if possible. Returns the size of the object
+  // in bytes; 0 if there is no valid entry.
   uint64_t readEntry(uint64_t offset, uint64_t from, EntryHeader& entry);
-  // Number of data objects that an entry of `size` bytes refers to.
+  // How many data objects an entry object of `size` bytes refers to.
   size_t itemCount(uint64_t size) const {
     return static_cast<size_t>((size - journal_format::kEntryItemsAt) >> itemShift_);
   }
   size_t itemSize() const { return size_t{1} << itemShift_; }
   // Bytes of a data object before its payload.
   size_t dataHeaderSize() const { return dataHeaderSize_; }
-  // Bytes of a data object that are read at most, payload included.
+  // The most bytes of a data object that are read: its header and the head of its payload.
   static constexpr size_t kMaxDataRead = journal_format::kCompactDataHeaderSize + kMaxFieldHead;
 
   // Fills `data` from the data object at `offset`, with up to kMaxFieldHead bytes of its payload;
-  // false where there is none. The window stays; what it does not hold is read into `scratch`.
+  // false if there is no valid one. The window does not move: an old value far away must not push
+  // out the entries that come next. What is not in the window is read into `scratch`.
   bool readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch, DataObject& data);
 
  private:

@@ -1,11 +1,28 @@
-// The journal file format as far as reading needs it: places of fields, object types, flags.
+// JournalFormat: where the journal file format keeps what a reader needs.
 //
-// A file is a header, then the arena: objects that are only ever appended, each aligned to eight
-// bytes and led by its type and size. All integers are little-endian. A data object holds one
-// FIELD=value, an entry object lists the data objects of one entry, and a chain of entry arrays,
-// each about twice as long as the one before, lists the entries in order.
+// A file is a header and then the arena, a row of objects. Writers only append objects; they change
+// old ones only to link new ones to them. Each object begins at a multiple of eight bytes with its
+// type (one byte), its flags (one byte), six zero bytes and its size (eight bytes). All integers
+// are little-endian; all links are offsets from the beginning of the file, and 0 means "none".
 //
-// The compact layout has 32-bit offsets in entries and entry arrays and a longer data header.
+//   header --kEntryArrayAt--> entry array --kArrayNextAt--> entry array --> ... --> 0
+//      |                        | | |        (each about twice as long as the one before)
+//      |                        v v v
+//      |                      entry: number, times, boot, and a list of data objects
+//      |                                              |
+//      |                                              v
+//      |                      data: one FIELD=value, stored once, compressed or not
+//      |                        ^   |--kDataFirstEntryAt--> the first entry that has this value
+//      |                        |   |--kDataEntryArrayAt--> entry arrays with the others
+//      |                        |   '--kNextValueAt-------> an older value of the same field
+//      '--kFieldTableAt--> field: one name --kFieldFirstValueAt (the newest value)
+//
+// The hash table of fields is a row of buckets. A bucket holds the offset of its first field, and
+// kNextInBucketAt leads from there to the others. There is such a table for data too; we do not
+// need it, because we never look up a value that we have not seen.
+//
+// Files with the flag kCompact have 32-bit offsets in entries and entry arrays, and a longer data
+// header.
 
 #pragma once
 
@@ -17,38 +34,40 @@ namespace tessel::journal_format {
 
 inline constexpr char kSignature[9] = "LPKSHHRH";
 
-// The shortest header that is understood; what newer writers append is optional.
+// The shortest header that was ever written. Newer writers append to it, which we may ignore.
 inline constexpr uint64_t kMinHeaderSize = 208;
-// What is read of a longer one.
+// We read a longer header up to here: kFieldCountAt is the last value that we use.
 inline constexpr uint64_t kHeaderRead = 224;
-// A header that claims more than this is damaged.
+// Writers use less than 300 bytes. A header that claims more than a page is damaged.
 inline constexpr uint64_t kMaxHeaderSize = 4096;
 
+// A file with a flag that we do not know cannot be read by us.
 enum IncompatibleFlag : uint32_t {
   kCompressedXz = 1,
   kCompressedLz4 = 2,
-  kKeyedHash = 4,
+  kKeyedHash = 4,  // concerns the hash tables' order, which we do not depend on
   kCompressedZstd = 8,
   kCompact = 16,
 };
 inline constexpr uint32_t kKnownIncompatibleFlags =
     kCompressedXz | kCompressedLz4 | kKeyedHash | kCompressedZstd | kCompact;
 
+// A writer sets kOnline when it opens a file. The file may then change while we read it.
 enum FileState : uint8_t { kOffline = 0, kOnline = 1, kArchived = 2 };
 
-// Places in the header.
+// Offsets in the header.
 inline constexpr size_t kIncompatibleFlagsAt = 12;
 inline constexpr size_t kStateAt = 16;
 inline constexpr size_t kSequenceIdAt = 72;
 inline constexpr size_t kHeaderSizeAt = 88;
 inline constexpr size_t kArenaSizeAt = 96;
-inline constexpr size_t kFieldTableAt = 120;
+inline constexpr size_t kFieldTableAt = 120;  // of the first bucket, not of the table's object
 inline constexpr size_t kFieldTableSizeAt = 128;
-inline constexpr size_t kTailObjectAt = 136;
+inline constexpr size_t kTailObjectAt = 136;  // the object that was appended last
 inline constexpr size_t kEntryCountAt = 152;
 inline constexpr size_t kEntryArrayAt = 176;
-inline constexpr size_t kHeadRealtimeAt = 184;
-inline constexpr size_t kTailRealtimeAt = 192;
+inline constexpr size_t kHeadRealtimeAt = 184;  // of the first entry that was written
+inline constexpr size_t kTailRealtimeAt = 192;  // of the last one
 inline constexpr size_t kFieldCountAt = 216;
 
 enum ObjectType : uint8_t {
@@ -59,27 +78,28 @@ enum ObjectType : uint8_t {
   kDataHashTable = 4,
   kFieldHashTable = 5,
   kEntryArray = 6,
-  kTag = 7,
+  kTag = 7,  // seals what stands before it; we do not check seals
 };
 
+// How a payload is compressed. A data object has at most one of these flags.
 enum DataFlag : uint8_t { kXz = 1, kLz4 = 2, kZstd = 4 };
 inline constexpr uint8_t kKnownDataFlags = kXz | kLz4 | kZstd;
 
+// Offsets in objects, from the beginning of the object; and sizes in bytes.
 inline constexpr size_t kObjectHeaderSize = 16;
 inline constexpr size_t kObjectSizeAt = 8;
 
-// A hash table is a row of buckets; objects in one bucket are linked.
-inline constexpr size_t kBucketSize = 16;
+inline constexpr size_t kBucketSize = 16;  // the first and the last object of the bucket
 inline constexpr size_t kNextInBucketAt = 24;
 
-inline constexpr size_t kNextValueAt = 32;  // of the same field
+inline constexpr size_t kNextValueAt = 32;
 inline constexpr size_t kDataFirstEntryAt = 40;
-inline constexpr size_t kDataEntryArrayAt = 48;  // lists the entries but for the first
-inline constexpr size_t kDataEntryCountAt = 56;
+inline constexpr size_t kDataEntryArrayAt = 48;
+inline constexpr size_t kDataEntryCountAt = 56;  // all entries, the first one included
 inline constexpr size_t kDataHeaderSize = 64;
 inline constexpr size_t kCompactDataHeaderSize = 72;
 
-inline constexpr size_t kFieldFirstValueAt = 32;  // the one that was added last
+inline constexpr size_t kFieldFirstValueAt = 32;
 inline constexpr size_t kFieldHeaderSize = 40;
 inline constexpr size_t kTagSize = 64;
 
@@ -89,16 +109,16 @@ inline constexpr size_t kEntryMonotonicAt = 32;
 inline constexpr size_t kEntryBootAt = 40;
 inline constexpr size_t kEntryHashAt = 56;
 inline constexpr size_t kEntryItemsAt = 64;
-inline constexpr size_t kEntryItemSize = 16;
+inline constexpr size_t kEntryItemSize = 16;  // an offset and the hash of the data
 inline constexpr size_t kCompactEntryItemSize = 4;
 
 inline constexpr size_t kArrayNextAt = 16;
 inline constexpr size_t kArrayItemsAt = 24;
 
-// Times beyond this many microseconds, some 1,100 years, are taken for damage.
+// 2^55 microseconds are some 1,100 years. A later time is damage.
 inline constexpr uint64_t kMaxTime = uint64_t{1} << 55;
-// So are sequence numbers beyond this one: the files that are merged with the one that holds such a
-// number would all come before the rest of it.
+// A million entries a second reach 2^48 after nine years. A greater number is damage. We must not
+// believe it: files are merged by number, so the rest of this file would come after all others.
 inline constexpr uint64_t kMaxSequenceNumber = uint64_t{1} << 48;
 
 template <typename T>

@@ -1,3 +1,5 @@
+// Opens each file with the reader for its kind, and filters and counts what the merge delivers.
+
 #include "journal/JournalStore.h"
 
 #include <algorithm>
@@ -14,7 +16,8 @@ namespace tessel {
 
 namespace {
 
-// Follows the numbers of each sequence and counts those that do not appear.
+// Counts the sequence numbers that do not appear. The daemon numbers entries without gaps, so a gap
+// means that a file was removed or damaged.
 class SequenceWatch {
  public:
   void see(const EntryHeader& entry) {
@@ -28,7 +31,8 @@ class SequenceWatch {
   uint64_t missing() const { return missing_; }
 
  private:
-  // Sequences beyond this number are not followed.
+  // A machine has a few sequences, one for each daemon that ever ran with new files. They are
+  // looked up one by one, so a store that was made to have thousands is followed only in part.
   static constexpr size_t kMaxSequences = 1024;
 
   struct Sequence {
@@ -37,6 +41,7 @@ class SequenceWatch {
   };
 
   void advance(Sequence& sequence, uint64_t number) {
+    // A lower number comes only from damage or copies. Going back would count the gap again.
     if (number <= sequence.number) return;
     const uint64_t leftOut = number - sequence.number - 1;
     gaps_ += leftOut != 0;
@@ -67,7 +72,7 @@ void SequenceWatch::change(const EntryHeader& entry) {
 
 static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
 
-// Of a stream whose entries may count in any sequence.
+// The sequence of a stream whose entries may count in any.
 constexpr Id128 kNoSequence{};
 
 }  // namespace
@@ -98,7 +103,7 @@ struct JournalStore::State final : EntryStream {
   ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
   const std::vector<EntryMark> marks = tokenizer.marks();
-  StoreReport facts;  // its files are complete before the first stream is made
+  StoreReport facts;  // streams refer to its files, so their number is set before the first stream
   size_t usableFiles = 0;
   ErrorCode firstFailure = ErrorCode::notAStore;  // of the first file, where it is not usable
   size_t foreignFiles = 0;                        // that journalctl reads for us
@@ -109,6 +114,7 @@ struct JournalStore::State final : EntryStream {
 bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
+    // Entries outside the range count for gaps and age: they show how far back the store reaches.
     sequences.see(entry);
     seeTime(entry.realtime);
     if (entry.realtime < range.start || entry.realtime >= range.end) continue;
@@ -176,7 +182,7 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
              number, header.sequenceId);
 }
 
-// Each such file takes a process, so not all of a great many are read.
+// A file that only a newer reader understands. The machine's own journalctl is likely to be one.
 void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
   FileReport& report = facts.files[number];
   if (foreignFiles == kMaxForeignFiles) {
@@ -195,8 +201,10 @@ void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint
   merger.add(std::move(stream), number, kNoSequence);
 }
 
-// A clock that was set back within the file shows where its ends stand the wrong way round; one
-// that was also set forward again does not, and the file counts as what its ends say.
+// Skipping a file by the times of its first and last entry spares most of the work of a run over a
+// long journal. If the clock was set back within the file, the two are usually the wrong way round,
+// and then it is read. If the clock was also set forward again, they are not, and the few entries
+// between the two changes are lost. Looking at each entry would be the price of finding them.
 bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   if (header.beingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
@@ -204,7 +212,8 @@ bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   return header.tailRealtime < range.start || header.headRealtime >= range.end;
 }
 
-// Why the store as a whole cannot be used, where that is so.
+// Why the store as a whole cannot be used; nothing if it can. One file that can be read is enough:
+// what was wrong with the others is in the report.
 std::optional<PlatformError> JournalStore::State::failure(const std::string& place) const {
   if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
   if (facts.files.empty())

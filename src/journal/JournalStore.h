@@ -1,10 +1,10 @@
-// JournalStore: the journal and export files of one place, opened for one time range and merged.
+// JournalStore: the journal and export files of one place, merged, for one time range.
 //
 // A store is a directory that holds `*.journal`, `*.journal~` or `*.export` files at any depth, one
-// such file, or the machine's own journal. Its files are held open from the beginning and known by
-// device and inode, so that a rotation meanwhile neither loses a file nor reads it twice.
+// such file, or the journal of this machine. All files are opened at the beginning and stay open,
+// so a rotation meanwhile neither hides a file nor shows it twice.
 //
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -27,15 +27,17 @@ struct TimeRange {
 
 class JournalStore {
  public:
-  // Files of a store that are looked at; the others are counted in the report.
+  // Each file takes a descriptor, a window and some 2 KiB. 8,192 files are 40 MB, a third of what a
+  // run may take. Further files are only counted in the report. TokenCache has 13 bits for them.
   static constexpr size_t kMaxFiles = 8192;
-  // Files of a layout that is not known; each is read by a journalctl of its own.
+  // Files of an unknown layout that are read. Each takes a process with up to 1 GiB of addresses,
+  // and all of them run at the same time because they are merged.
   static constexpr size_t kMaxForeignFiles = 16;
 
-  // Opens the store at `path`, the machine's own journal where it is absent. An error names the
-  // path and the reason: there is no such place, it may not be read, it holds nothing that is a
-  // journal store. A damaged file among good ones is no error but a line of the report.
-  // `tokenizer` and `stop` must outlive the store.
+  // Opens the store at `path`; without a path, the journal of this machine. An error has a code and
+  // names the path: notFound, noAccess, notAStore (no file there is a journal), or failed. A
+  // damaged file among good ones is no error; the report tells of it. `tokenizer` and `stop` must
+  // outlive the store.
   static std::variant<std::unique_ptr<JournalStore>, PlatformError> open(
       const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
       const StopFlag& stop);
@@ -46,7 +48,7 @@ class JournalStore {
 
   // The entries of the range in the journal's own order, each once.
   EntryStream& entries();
-  // What is known so far; complete once entries().next() has answered false.
+  // What is known so far. Complete after entries().next() has returned false.
   StoreReport report() const;
 
  private:

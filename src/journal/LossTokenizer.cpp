@@ -1,3 +1,5 @@
+// Counts and units of lost entries as tokens.
+
 #include "journal/LossTokenizer.h"
 
 #include <algorithm>
@@ -13,14 +15,15 @@ constexpr std::string_view kCount = "N_DROPPED";
 constexpr std::string_view kUnit = "OBJECT_SYSTEMD_UNIT";
 constexpr std::string_view kLossMessage = "a596d6fe7bfa4994828e72309e95d61e";
 
-// The message, then the counts, each by its number, then the units.
+// Our tokens: the message, then 2^30 - 1 for counts, then one for each unit. A count is its own
+// token, so that no number of different counts needs memory.
 constexpr FieldToken kLossToken = kFirstReservedToken;
 constexpr FieldToken kFirstCount = kFirstReservedToken + 1;
 constexpr FieldToken kFirstUnit = kFirstReservedToken + 0x40000000;
 
 bool isOurs(FieldToken token) { return token >= kFirstReservedToken; }
 
-// A count beyond what a token can say is taken for the greatest that it can.
+// A greater count than a token can hold, about a billion, becomes the greatest.
 FieldToken countToken(std::string_view value) {
   uint64_t number = 0;
   const auto [end, error] = std::from_chars(value.data(), value.data() + value.size(), number);
@@ -31,6 +34,7 @@ FieldToken countToken(std::string_view value) {
 
 }  // namespace
 
+// A user without marks sees every entry, and so do we.
 std::vector<EntryMark> LossTokenizer::marks() const {
   std::vector<EntryMark> marks = user_.marks();
   if (!marks.empty()) marks.push_back({kMessageId, kLossMessage});
@@ -63,6 +67,8 @@ FieldToken LossTokenizer::unitToken(std::string_view name) {
 }
 
 std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
+  // Nearly all stores have no such entry, and nearly all entries are none: one pass without a
+  // branch finds out.
   if (!met_) return tokens;
   FieldToken highest = 0;
   for (const FieldToken token : tokens) highest = std::max(highest, token);

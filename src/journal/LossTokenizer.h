@@ -1,5 +1,8 @@
-// LossTokenizer: stands before the tokenizer of a store's user and keeps for the store the fields
-// of the entries in which the journal daemon says that it dropped others.
+// LossTokenizer: notices the entries in which the journal daemon says that it dropped others.
+//
+// It stands between the readers and the tokenizer of the store's user. It keeps the fields of such
+// an entry under tokens of its own and takes them away before the user sees the entry. So the store
+// counts what was dropped, and its users need not know how the daemon says it.
 //
 // Threads: one at a time.
 
@@ -17,7 +20,8 @@ namespace tessel {
 
 class LossTokenizer final : public FieldTokenizer {
  public:
-  // Units that are kept apart, and the longest name of one; what others lost is counted under none.
+  // Anyone may write such entries, so both are bounded. Further units, and longer names (systemd
+  // allows 255 bytes), are counted together under the empty name.
   static constexpr size_t kMaxUnits = 4096;
   static constexpr size_t kMaxUnitLength = 256;
 
@@ -29,10 +33,10 @@ class LossTokenizer final : public FieldTokenizer {
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return user_.generation(); }
 
-  // The user's tokens among those of an entry; valid until the next call. Where the entry tells of
-  // a loss, that is counted.
+  // The tokens of an entry without our own; valid until the next call. If the entry tells of a
+  // loss, counts it. Call it once for each entry.
   std::span<const FieldToken> takeOwn(std::span<const FieldToken> tokens);
-  // What was counted, of no unit first, then in order of first sight.
+  // What was counted: first what belongs to no unit, then the units in the order they were met.
   std::vector<DroppedEntries> dropped() const;
 
  private:
@@ -40,9 +44,9 @@ class LossTokenizer final : public FieldTokenizer {
   void count(std::span<const FieldToken> own);
 
   FieldTokenizer& user_;
-  bool met_ = false;  // an entry may tell of a loss
+  bool met_ = false;  // whether the daemon's message was ever shown
   std::map<std::string, FieldToken, std::less<>> unitTokens_;
-  std::vector<DroppedEntries> units_ = std::vector<DroppedEntries>(1);  // first what is of none
+  std::vector<DroppedEntries> units_ = std::vector<DroppedEntries>(1);  // the first has no name
   std::vector<FieldToken> theirs_;
 };
 

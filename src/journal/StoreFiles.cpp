@@ -1,3 +1,5 @@
+// Lists directories until a listing shows nothing new.
+
 #include "journal/StoreFiles.h"
 
 #include <dirent.h>
@@ -11,15 +13,18 @@
 #include <memory>
 #include <set>
 #include <string_view>
-#include <system_error>
 #include <utility>
+
+#include "os/Files.h"
 
 namespace tessel {
 
 namespace {
 
+// Journals lie one directory deep, collected ones a few. Each level holds a descriptor open, and
+// the file system may have a loop of mounts.
 constexpr int kDeepestDirectory = 32;
-// A store that rotates faster than it is listed has been listed often enough after this many times.
+// Two listings are usual. A place where each listing finds a new file is filled on purpose.
 constexpr int kMostListings = 8;
 
 std::optional<StoreFileKind> kindOf(std::string_view name) {
@@ -46,7 +51,7 @@ class Finder {
   const StopFlag& stop_;
   StoreFiles found_;
   std::set<std::pair<dev_t, ino_t>> known_;
-  std::vector<StoreFile> failed_;  // of the listing under way
+  std::vector<StoreFile> failed_;  // files that the current listing could not open
 };
 
 int Finder::addDirectory(const std::string& directory) {
@@ -56,7 +61,7 @@ int Finder::addDirectory(const std::string& directory) {
   const uint64_t leftOutElsewhere = found_.leftOut;
   for (int i = 0; i < kMostListings && before != known_.size() && !stop_.load(); ++i) {
     before = known_.size();
-    // What fails only now and then was renamed or removed.
+    // What fails in one listing and not in the next was renamed or removed in between.
     failed_.erase(failed_.begin() + static_cast<ptrdiff_t>(failedElsewhere), failed_.end());
     found_.leftOut = leftOutElsewhere;
     error = list(directory, 0);
@@ -79,7 +84,7 @@ void Finder::visit(const std::string& path, const dirent& entry, int depth) {
   const std::string_view name = entry.d_name;
   if (name == "." || name == "..") return;
   bool isDirectory = entry.d_type == DT_DIR;
-  if (entry.d_type == DT_UNKNOWN) {
+  if (entry.d_type == DT_UNKNOWN) {  // some file systems do not tell
     struct stat status {};
     isDirectory = ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
   }
@@ -92,7 +97,8 @@ void Finder::visit(const std::string& path, const dirent& entry, int depth) {
   if (error != 0 && error != ENOENT) fail(path, StoreFileKind::journal, error);
 }
 
-// Opening must not wait for the other end of a pipe, so that comes before asking what it is.
+// Opens first and asks what it is afterwards; otherwise it could be exchanged in between. So
+// opening must not wait: a pipe would wait for its other end.
 void Finder::addFile(const std::string& path, StoreFileKind kind) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!fd.valid()) {
@@ -121,13 +127,14 @@ void Finder::fail(const std::string& path, StoreFileKind kind, int error) {
 
 StoreFiles Finder::take() {
   std::move(failed_.begin(), failed_.end(), std::back_inserter(found_.files));
+  // The order of a listing differs from run to run; reports should not.
   std::sort(found_.files.begin(), found_.files.end(),
             [](const StoreFile& a, const StoreFile& b) { return a.path < b.path; });
   return std::move(found_);
 }
 
-// Every file of the store is held open; the usual soft limit of 1,024 is for programs that
-// select().
+// Every file of the store stays open. The usual soft limit of 1,024 protects programs that use
+// select(); we do not, so we raise it.
 void allowOpenFiles(size_t count) {
   rlimit limit{};
   if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= count) return;
@@ -159,7 +166,7 @@ std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
 }  // namespace
 
 std::string whyNotOpened(int error) {
-  std::string text = std::generic_category().message(error);
+  std::string text = errorWords(error);
   if (error == EACCES || error == EPERM)
     text += " (members of the group systemd-journal may read the journal)";
   return text;
@@ -167,7 +174,7 @@ std::string whyNotOpened(int error) {
 
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
                                                        size_t limit, const StopFlag& stop) {
-  constexpr size_t kOtherFiles = 256;
+  constexpr size_t kOtherFiles = 256;  // descriptors for everything else in the process
   allowOpenFiles(limit + kOtherFiles);
   Finder finder(limit, stop);
   if (!path) return machineJournal(finder);

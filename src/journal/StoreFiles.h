@@ -1,10 +1,11 @@
 // StoreFiles: finds and opens the files of a journal store.
 //
-// Files are held open from the moment they are found and known by device and inode. The place is
-// listed again until nothing new shows up, so that a file that is renamed meanwhile is neither lost
-// nor met twice.
+// The daemon renames and removes files while we list them. So each file is opened when it is found
+// and known by device and inode, not by name, and the place is listed again until nothing new shows
+// up. A file that is renamed meanwhile is then neither lost nor taken twice. Locking the directory
+// would be simpler, but the daemon takes no such lock.
 //
-// Threads: one at a time, but for the stop flag.
+// Threads: one at a time, except for the stop flag.
 
 #pragma once
 
@@ -23,10 +24,10 @@ namespace tessel {
 enum class StoreFileKind { journal, exportStream };
 
 struct StoreFile {
-  std::string path;  // as it was found; it may have another name by now
+  std::string path;  // when it was found; the file may have another name by now
   StoreFileKind kind = StoreFileKind::journal;
-  UniqueFd fd;    // not valid where it could not be opened
-  int error = 0;  // errno of opening it, then
+  UniqueFd fd;    // not valid if the file could not be opened
+  int error = 0;  // errno, if the file could not be opened
 };
 
 struct StoreFiles {
@@ -34,12 +35,12 @@ struct StoreFiles {
   uint64_t leftOut = 0;  // files beyond the limit
 };
 
-// The files at `path`, a directory or one file, or of the machine's own journal where it is absent;
-// at most `limit`. An error where there is no such place or it may not be read.
+// Opens the files at `path`, a directory or one file; without a path, those of this machine's
+// journal; at most `limit`. An error if there is no such place or it cannot be read.
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
                                                        size_t limit, const StopFlag& stop);
 
-// What `error`, an errno, says, with what to do about it where access was denied.
+// The words for the errno `error`; if access was denied, with what to do about it.
 std::string whyNotOpened(int error);
 
 }  // namespace tessel

@@ -1,10 +1,17 @@
-// TokenCache: which token a data object of which file has, remembered in a fixed amount of memory.
+// TokenCache: remembers which token a data object of a file has, in half a megabyte.
 //
-// One cache serves all files of a store, so its size depends neither on their number nor on theirs.
-// A place has a set of two slots: what is new comes into the second and takes the first when it is
-// met again, so that the many values that occur once or twice do not push out those that recur. No
-// two data objects begin within the same 64 bytes, so that is how exactly places are told apart.
-// What falls out is asked for again.
+// Without it each entry would cost a read and a lookup for each of its fields. One cache serves all
+// files of a store, so its size depends neither on their number nor on theirs. It fits the
+// processor's second-level cache; a table of all data objects would not, and could not be bounded.
+// What the cache has forgotten is read and shown to the tokenizer again.
+//
+// A key is the number of the file and the offset of the object. It selects a set of two slots. A
+// new token goes to the second slot, and moves to the first when it is found there. So values that
+// occur once, most values of a journal, push out one another, but not those that recur.
+//
+// A slot must never return the token of another object: that would be a wrong value in an event. So
+// a slot holds the part of the key that does not select the set (the tag), and set and tag together
+// are the whole key. Offsets are divided by 64: a data object is larger, so no two have one key.
 //
 // Threads: one at a time.
 
@@ -21,12 +28,12 @@ namespace tessel {
 
 class TokenCache {
  private:
-  static constexpr int kPlaceShift = 6;
-  static constexpr int kPlaceBits = 32;  // of a place in a file
+  static constexpr int kPlaceShift = 6;  // the header of a data object alone has 64 bytes
+  static constexpr int kPlaceBits = 32;  // of an offset, after the shift
   static constexpr int kFileBits = 13;
-  static constexpr int kSetBits = 15;
+  static constexpr int kSetBits = 15;  // 2^15 sets of 16 bytes are 512 KiB
   static constexpr int kKeyBits = kPlaceBits + kFileBits;
-  static constexpr int kTagBits = kKeyBits - kSetBits;
+  static constexpr int kTagBits = kKeyBits - kSetBits;  // 30, so that a tag fits 32 bits
   static constexpr size_t kSets = size_t{1} << kSetBits;
   struct Slot {
     uint32_t tag;
@@ -38,16 +45,17 @@ class TokenCache {
   };
 
  public:
-  // Files whose tokens can be remembered; the number of one is below it.
+  // Numbers of files are below this.
   static constexpr uint32_t kMaxFiles = uint32_t{1} << kFileBits;
-  // No journal is as large as that; greater offsets would be taken for others.
+  // 2^38 bytes, 256 GiB, of a file. An object beyond would have the key of another one, so it is
+  // never remembered; the daemon rotates its files long before.
   static constexpr uint64_t kMaxOffset = (uint64_t{1} << (kPlaceBits + kPlaceShift)) - 1;
-  // Answered where nothing is remembered. No token has this value.
+  // What find() returns if nothing is remembered. No token has this value.
   static constexpr FieldToken kUnknown = UINT32_MAX;
 
   TokenCache() : sets_(std::make_unique_for_overwrite<Set[]>(kSets)) { clear(); }
 
-  // Forgets everything where what it remembers is of another generation of tokens.
+  // Forgets everything if `generation` is not that of the tokens it remembers.
   void useGeneration(uint32_t generation) {
     if (generation == generation_) [[likely]]
       return;
@@ -55,16 +63,14 @@ class TokenCache {
     clear();
   }
 
-  // What is remembered of one file. Valid while the cache lives, and small enough to be made for
-  // every entry.
+  // The view of one file. Valid while the cache lives; cheap enough to make for every entry.
   class OfFile {
    public:
     // REQUIRES: file < kMaxFiles.
     OfFile(TokenCache& cache, uint32_t file)
         : sets_(cache.sets_.get()), file_(uint64_t{file} << kPlaceBits) {}
 
-    // The token of the data object at `offset`, at most kMaxOffset; kUnknown where it is not
-    // remembered.
+    // The token of the data object at `offset`, or kUnknown. REQUIRES: offset <= kMaxOffset.
     FieldToken find(uint64_t offset) const {
       const uint64_t key = keyOf(offset);
       Set& set = sets_[key >> kTagBits];
@@ -82,7 +88,8 @@ class TokenCache {
     }
 
    private:
-    // An odd factor maps the places one to one, so slot and tag together are the place.
+    // Multiplying by an odd number modulo a power of two loses nothing, and spreads neighbouring
+    // objects over the sets. The number is 2^64 divided by the golden ratio.
     uint64_t keyOf(uint64_t offset) const {
       constexpr uint64_t kKeys = (uint64_t{1} << kKeyBits) - 1;
       return (file_ | offset >> kPlaceShift) * 0x9e3779b97f4a7c15u & kKeys;
@@ -96,7 +103,7 @@ class TokenCache {
   };
 
  private:
-  // An empty slot answers for whatever place has its tag.
+  // An empty slot has a tag too, 0, so it answers kUnknown for the key that has this tag.
   void clear() { std::fill_n(sets_.get(), kSets, Set{{0, kUnknown}, {0, kUnknown}}); }
 
   uint32_t generation_ = 0;
