@@ -164,7 +164,7 @@ TEST_P(ExportEntryStreamTest, anEntryWithTooMuchInItIsBad) {
   EXPECT_THAT(problems(), ElementsAre("entry with too many fields at 0 x1"));
 }
 
-TEST_P(ExportEntryStreamTest, anEntryIsThereWithItsEmptyLine) {
+TEST_P(ExportEntryStreamTest, anEntryEndsWithItsEmptyLine) {
   const std::string entry = "__REALTIME_TIMESTAMP=3\n" + binary("T", "a\n\nb") + "T=c\n\n";
   for (const char& byte : entry) {
     EXPECT_THAT(readAll(), IsEmpty());
@@ -177,7 +177,7 @@ TEST_P(ExportEntryStreamTest, anEntryIsThereWithItsEmptyLine) {
   EXPECT_THAT(problems(), ElementsAre("incomplete last entry at 0 x2"));
 }
 
-TEST_P(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
+TEST_P(ExportEntryStreamTest, anEntryMayExceedTheWindow) {
   const std::string start =
       "__REALTIME_TIMESTAMP=3\nT=first\n" + binary("MESSAGE", std::string(400'000, 'm'));
   append(start);
@@ -186,7 +186,7 @@ TEST_P(ExportEntryStreamTest, anEntryLargerThanTheWindowIsReadWhenItIsWhole) {
   EXPECT_THAT(readAll(), ElementsAre("3: T=first"));
 }
 
-TEST_P(ExportEntryStreamTest, manyLongWrongLengthsAreNotAllGoneBackWithin) {
+TEST_P(ExportEntryStreamTest, wrongLengthsCostLinearTime) {
   std::string text;
   for (int i = 0; i < 50'000; ++i) text += binary("A", "", 300'007) + "\n";
   for (int i = 0; i < 20'000; ++i) text += kGood;
@@ -197,7 +197,7 @@ TEST_P(ExportEntryStreamTest, manyLongWrongLengthsAreNotAllGoneBackWithin) {
   EXPECT_LT(report.problems[0].count, 50u);
 }
 
-TEST_P(ExportEntryStreamTest, badDataThatIsNotOverYetIsCountedOnce) {
+TEST_P(ExportEntryStreamTest, unfinishedBadDataCountsOnce) {
   append("garbage\nmore");
   EXPECT_THAT(readAll(), IsEmpty());
   append(" garbage\n\n");
@@ -255,7 +255,7 @@ TEST_F(ExportResourcesTest, whatAllStreamsKeepIsBounded) {
   EXPECT_EQ(resources_.bytesKept, 0u);
 }
 
-TEST_F(ExportResourcesTest, theMemoryOfALargeEntryIsGivenBackWithTheNext) {
+TEST_F(ExportResourcesTest, aLargeEntryGivesItsMemoryBack) {
   const auto taken = [] { return ::mallinfo2().uordblks + ::mallinfo2().hblkhd; };
   const size_t before = taken();
   for (int i = 0; i < 40; ++i) {

@@ -74,7 +74,7 @@ class JournalDamageTest : public ::testing::TestWithParam<bool> {
 
 INSTANTIATE_TEST_SUITE_P(Layouts, JournalDamageTest, ::testing::Bool());
 
-TEST_P(JournalDamageTest, FindsAllEntriesWhereTheChainIsDamaged) {
+TEST_P(JournalDamageTest, FindsAllBehindADamagedChain) {
   constexpr size_t kEntries = 3000;
   const JournalWriter writer = journalOf(kEntries, layout());
   using Fault = std::function<void(std::string&, uint64_t array)>;
@@ -104,7 +104,7 @@ TEST_P(JournalDamageTest, FindsAllEntriesWhereTheChainIsDamaged) {
   }
 }
 
-TEST_P(JournalDamageTest, FindsAllEntriesWhereTheHeaderIsDamaged) {
+TEST_P(JournalDamageTest, FindsAllBehindADamagedHeader) {
   const JournalWriter writer = journalOf(1000, layout());
   for (const uint64_t wrong : {uint64_t{0}, uint64_t{7}, uint64_t{1} << 40, UINT64_MAX}) {
     for (const size_t at :
@@ -120,7 +120,7 @@ TEST_P(JournalDamageTest, FindsAllEntriesWhereTheHeaderIsDamaged) {
   }
 }
 
-TEST_P(JournalDamageTest, LosesOnlyTheEntriesThatAreDamaged) {
+TEST_P(JournalDamageTest, LosesOnlyDamagedEntries) {
   const JournalWriter writer = journalOf(1000, layout());
   std::string file = writer.bytes();
   for (const size_t index : {size_t{0}, size_t{1}, size_t{500}, size_t{999}})
@@ -133,7 +133,7 @@ TEST_P(JournalDamageTest, LosesOnlyTheEntriesThatAreDamaged) {
 }
 
 // Every 16 bytes what could be an object, each said to end far away among zeros that do not last.
-TEST_P(JournalDamageTest, ReadsAFileMadeToBeSearchedForeverInTimeOfItsSize) {
+TEST_P(JournalDamageTest, SearchTakesTimeOfTheFilesSize) {
   constexpr size_t kHalf = size_t{4} << 20;
   std::string file = journalOf(0, layout()).bytes();
   const size_t start = file.size();
@@ -202,14 +202,14 @@ class JournalMeanwhileTest : public ::testing::Test {
   const std::string path_ = directory_.path("a.journal");
 };
 
-TEST_F(JournalMeanwhileTest, AFileThatIsRemovedOrRenamedIsReadToItsEnd) {
+TEST_F(JournalMeanwhileTest, RemovedOrRenamedIsReadWhole) {
   const auto rename = [&](size_t) { std::filesystem::rename(path_, directory_.path("b.journal")); };
   const auto remove = [&](size_t) { std::filesystem::remove(path_); };
   for (const Outcome& outcome : readWith(rename)) EXPECT_EQ(outcome.numbers.size(), kEntries);
   for (const Outcome& outcome : readWith(remove)) EXPECT_EQ(outcome.numbers.size(), kEntries);
 }
 
-TEST_F(JournalMeanwhileTest, AFileThatIsCutLosesWhatWasCutAndThatIsTold) {
+TEST_F(JournalMeanwhileTest, ReportsWhatACutLoses) {
   std::mt19937 random(1);
   std::vector<size_t> sizes;
   const auto outcomes = readWith([&](size_t) {
@@ -225,7 +225,7 @@ TEST_F(JournalMeanwhileTest, AFileThatIsCutLosesWhatWasCutAndThatIsTold) {
   }
 }
 
-TEST_F(JournalMeanwhileTest, AFileThatTheDaemonClosesLosesItsUnusedEndAndNothingIsToldOfIt) {
+TEST_F(JournalMeanwhileTest, ClosingAFileIsNoLoss) {
   for (const uint8_t state : {kOnline, kArchived}) {
     std::string file = journalOf(kEntries, {.state = state}).bytes();
     const size_t used = file.size();
@@ -238,7 +238,7 @@ TEST_F(JournalMeanwhileTest, AFileThatTheDaemonClosesLosesItsUnusedEndAndNothing
   }
 }
 
-TEST_F(JournalMeanwhileTest, AFileThatIsPunchedLosesWhatWasPunchedAndThatIsTold) {
+TEST_F(JournalMeanwhileTest, ReportsWhatAHoleLoses) {
   constexpr size_t kHole = 64 << 10;
   std::mt19937 random(1);
   std::vector<size_t> holes;

@@ -59,7 +59,7 @@ std::string someJournal(size_t count, uint64_t firstSequence = 1, JournalLayout 
   return writer.bytes();
 }
 
-TEST(JournalStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
+TEST(JournalStoreTest, ReadsAllLayoutsLikeLibsystemd) {
   using namespace journal_format;
   const JournalLayout layouts[] = {
       {.compression = kXz},
@@ -84,7 +84,7 @@ TEST(JournalStoreTest, ReadsWhatLibsystemdReadsInLayoutsOfOtherWriters) {
   }
 }
 
-TEST(JournalStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll) {
+TEST(JournalStoreTest, DeliversCopiesInOtherFilesOnce) {
   const TemporaryDirectory directory;
   directory.write("a.journal", someJournal(20, 1));
   directory.write("b.journal", someJournal(20, 11));
@@ -101,7 +101,7 @@ TEST(JournalStoreTest, DeliversAnEntryOfTwoFilesOnceAndEqualEntriesOfOneFileAll)
 
 // Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
 // all of them.
-TEST(JournalStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
+TEST(JournalStoreTest, DeliversOnceInACircularOrder) {
   constexpr size_t kEntries = 60;
   for (unsigned seed = 0; seed < 10; ++seed) {
     std::mt19937 random(seed);
@@ -135,7 +135,7 @@ TEST(JournalStoreTest, DeliversEachEntryOnceWhereTheOrderRunsInACircle) {
   }
 }
 
-TEST(JournalStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
+TEST(JournalStoreTest, SkipsClosedFilesOutsideTheRange) {
   const TemporaryDirectory directory;
   constexpr uint64_t kBase = 1'795'300'000'000'000;
   directory.write("a.journal", someJournal(10, 1));
@@ -151,7 +151,7 @@ TEST(JournalStoreTest, ReadsTheRangeAndSkipsClosedFilesOutsideIt) {
   EXPECT_TRUE(reading.report.reachesRangeStart());
 }
 
-TEST(JournalStoreTest, KeepsTheOrderAndFiltersEachEntryWhereTheClockWasSetBack) {
+TEST(JournalStoreTest, FiltersEachEntryByASetBackClock) {
   const TemporaryDirectory directory;
   JournalWriter system, user({.sequenceId = {9}});
   for (uint64_t i = 1; i <= 40; ++i) {
@@ -205,7 +205,7 @@ TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
 }
 
 // Anyone may write such entries, with any values.
-TEST(JournalStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
+TEST(JournalStoreTest, CountsEachOfManyLosses) {
   const TemporaryDirectory directory;
   JournalWriter writer;
   EntryHeader header;
@@ -228,7 +228,7 @@ TEST(JournalStoreTest, CountsEachLossHoweverManyCountsAndUnitsThereAre) {
   EXPECT_EQ(reading.report.dropped[0].unit, "");
 }
 
-TEST(JournalStoreTest, NamesPathAndReasonWhereThereIsNoStore) {
+TEST(JournalStoreTest, SaysWhyThereIsNoStore) {
   const TemporaryDirectory directory;
   const std::string noise = directory.write("noise/noise.journal", std::string(5000, '\x5a'));
   EXPECT_THAT(readStore("/nowhere").error, HasSubstr("/nowhere: No such file"));
@@ -254,7 +254,7 @@ TEST(JournalStoreTest, ReadsTheGoodFilesAmongBadOnes) {
 }
 
 // journalctl does not know the flag either, which is as near as a test comes to a newer one.
-TEST(JournalStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
+TEST(JournalStoreTest, LeavesUnknownFilesToJournalctl) {
   const TemporaryDirectory directory;
   std::string file = someJournal(10);
   file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;
@@ -273,7 +273,7 @@ TEST(JournalStoreTest, LeavesAFileWithUnknownFeaturesToJournalctl) {
 }
 
 // It would else be decompressed for each of the entry's items.
-TEST(JournalStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
+TEST(JournalStoreTest, DecompressesARepeatedValueOnce) {
   const TemporaryDirectory directory;
   JournalLayout layout;
   layout.compression = journal_format::kZstd;
@@ -295,7 +295,7 @@ TEST(JournalStoreTest, LooksOnceAtACompressedValueThatAnEntryNamesOften) {
   EXPECT_EQ(tokenizer.shown(), 1u);
 }
 
-TEST(JournalStoreTest, ReadsNoMoreThanSomeFilesWithUnknownFeatures) {
+TEST(JournalStoreTest, ReadsOnlySomeUnknownFiles) {
   const TemporaryDirectory directory;
   std::string file = someJournal(1);
   file[journal_format::kIncompatibleFlagsAt + 3] = 0x40;

@@ -89,14 +89,14 @@ class MarkedEntriesTest : public ::testing::TestWithParam<bool> {
 
 INSTANTIATE_TEST_SUITE_P(Layouts, MarkedEntriesTest, ::testing::Bool());
 
-TEST_P(MarkedEntriesTest, ShowsMarkedEntriesAndThoseThatTellOfALossAndNoOthers) {
+TEST_P(MarkedEntriesTest, ShowsOnlyMarksAndLosses) {
   Numbers expected;
   for (uint64_t i = 1; i <= kJournalSize; ++i)
     if (isMarked(i) || tellsOfLoss(i)) expected.insert(i);
   EXPECT_EQ(shown(markedJournal(layout()).bytes()), expected);
 }
 
-TEST_P(MarkedEntriesTest, ShowsEveryEntryWhereTheIndexDoesNotTell) {
+TEST_P(MarkedEntriesTest, ShowsAllWithoutAUsableIndex) {
   JournalWriter writer = markedJournal(layout());
   addEntry(writer, {"SUBSYSTEM=b"});
   EXPECT_EQ(shown(writer.bytes()).size(), kJournalSize + 1) << "a companion alone";
@@ -112,7 +112,7 @@ TEST_P(MarkedEntriesTest, ShowsEveryEntryWhereTheIndexDoesNotTell) {
     EXPECT_EQ(shown(markedJournal(other).bytes()).size(), kJournalSize);
 }
 
-TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
+TEST_P(MarkedEntriesTest, ADamagedIndexHidesNoMark) {
   const JournalWriter writer = markedJournal(layout());
   const std::string good = writer.bytes();
   const uint64_t buckets = wordAt(good, kFieldTableAt);
@@ -163,7 +163,7 @@ TEST_P(MarkedEntriesTest, LosesNoMarkedEntryWhereTheIndexIsDamaged) {
 }
 
 // An offset in a list that leads to no entry may hide the one that it stood for, and no other.
-TEST_P(MarkedEntriesTest, LosesOneEntryAtMostWhereAnOffsetIsWrongAndTellsOfIt) {
+TEST_P(MarkedEntriesTest, AWrongOffsetHidesOneEntry) {
   const JournalWriter writer = markedJournal(layout());
   std::string file = writer.bytes();
   const uint64_t item = writer.arraysOf("KIND=event")[3] + kArrayItemsAt;

@@ -11,7 +11,7 @@
 namespace tessel {
 namespace {
 
-TEST(TokenCacheTest, AnswersForAPlaceWhatWasLastStoredThereOrNothing) {
+TEST(TokenCacheTest, ReturnsTheLastStoredOrNothing) {
   TokenCache cache;
   std::mt19937_64 random(1);
   std::map<std::pair<uint32_t, uint64_t>, FieldToken> stored;
