@@ -63,7 +63,7 @@ std::optional<Decompressor::Result> Decompressor::decompressXz(const Source& sou
       stream.next_in = input_.data();
       stream.avail_in = source(position, input_);
       position += stream.avail_in;
-      if (stream.avail_in == 0) return std::nullopt;
+      if (stream.avail_in == 0) return std::nullopt;  // cut off: the stream has no end mark
     }
     state = lzma_code(&stream, LZMA_RUN);
     if (state == LZMA_STREAM_END) return Result{target.size() - stream.avail_out, true};
@@ -85,6 +85,7 @@ std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& so
       reinterpret_cast<const char*>(input_.data()) + kSizeBytes,
       reinterpret_cast<char*>(target.data()), static_cast<int>(got - kSizeBytes), wanted,
       static_cast<int>(target.size()));
+  // A block that holds less than it states leaves bytes of another value in `target`.
   if (produced < wanted) return std::nullopt;
   return Result{static_cast<size_t>(wanted), size <= target.size()};
 }

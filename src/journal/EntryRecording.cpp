@@ -116,7 +116,7 @@ std::optional<EntryHeader> lastEntry(int fd, off_t size) {
   for (off_t look = kFirstLook;; look *= 4) {
     const off_t from = std::max<off_t>(0, size - look);
     std::string tail = readAt(fd, from, static_cast<size_t>(size - from));
-    if (from == 0) tail.insert(0, kEntryEnd);
+    if (from == 0) tail.insert(0, kEntryEnd);  // the first entry has no empty line before it
     if (const auto header = lastEntryIn(tail)) return header;
     if (from == 0 || look > kLastLook) return std::nullopt;
   }
@@ -160,6 +160,7 @@ RecordOrigin currentOrigin() {
   std::error_code error;
   const auto image = std::filesystem::read_symlink("/proc/self/exe", error);
   if (!error) origin.imagePath = image.string();
+  // The daemon takes these from the kernel too, so a recorded entry looks like a received one.
   origin.processName = firstLineOf("/proc/self/comm");
   origin.process = std::to_string(::getpid());
   return origin;

@@ -112,6 +112,7 @@ ExportEntryStream::Outcome ExportEntryStream::readEntry() {
 }
 
 ExportEntryStream::Outcome ExportEntryStream::finishEntry() {
+  // Without a time an entry is in no range and has no place in the merge.
   if (hasRealtime_) return Outcome::complete;
   report_.addProblem("entry without __REALTIME_TIMESTAMP", entryPlace_);
   return Outcome::skipped;
@@ -157,6 +158,7 @@ ExportEntryStream::Outcome ExportEntryStream::readField(const Line& line) {
 }
 
 ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view name) {
+  // Copied, because filling the window for the value moves the name away.
   std::string head(name);
   head += '=';
   const uint64_t lengthPlace = window_.place();
@@ -199,6 +201,7 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   if (keptFields_.size() == kMaxFieldsKept || kept_.size() + head.size() > kMaxBytesKept) {
     return bad("entry with too many fields");
   }
+  // Refusing the entry here bounds memory; the entry is reported, and those of other files go on.
   const size_t more = keptBeyondUsual(head.size() + sizeof(KeptField)) - keptBeyondUsual(0);
   if (resources_.bytesKept + more > kMaxBytesKeptByAll) {
     return bad("entry too large beside those of other files");
@@ -264,6 +267,8 @@ void ExportEntryStream::waitAtEntry() {
 }
 
 Entry ExportEntryStream::entry() {
+  // Tokens are made here and not in next(): the merge holds an entry of each file for a long time,
+  // and tokens may become void meanwhile.
   resources_.tokens.clear();
   for (const KeptField& field : keptFields_) {
     const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);
@@ -318,6 +323,7 @@ pid_t startJournalctl(const std::string& path, int output) {
 std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
     const std::string& path, uint64_t entryCount, ExportReadResources& resources,
     FieldTokenizer& tokenizer, const StopFlag& stop, FileReport& report) {
+  // Close-on-exec: a later child that holds our end open would keep this one from ever ending.
   std::array<int, 2> ends{};
   if (::pipe2(ends.data(), O_CLOEXEC) != 0) return nullptr;
   UniqueFd input(ends[0]);
@@ -333,6 +339,8 @@ std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
 
 ForeignJournalStream::~ForeignJournalStream() {
   if (child_ == 0) return;
+  // It may be waiting to write to a pipe that nobody reads, or be busy with damage: no reason to
+  // ask.
   ::kill(child_, SIGKILL);
   endedWell(child_);
 }

@@ -81,6 +81,7 @@ uint64_t WindowedFile::nextWritten(uint64_t offset) const {
 
 size_t WindowedFile::read(uint64_t offset, std::span<uint8_t> target) {
   size_t done = 0;
+  // pread and not read: the window and the chains of a file share one descriptor.
   while (done < target.size()) {
     const ssize_t got = ::pread(fd_.get(), target.data() + done, target.size() - done,
                                 static_cast<off_t>(offset + done));
@@ -104,6 +105,7 @@ size_t WindowedFile::read(uint64_t offset, std::span<uint8_t> target) {
 ByteWindow::ByteWindow(int fd, const StopFlag& stop, WindowBudget& budget)
     : fd_(fd), stop_(stop), budget_(budget) {
   budget_.join();
+  // A pipe has no offset: it cannot go back, and reading it may have to wait.
   const off_t offset = ::lseek(fd, 0, SEEK_CUR);
   seekable_ = offset >= 0;
   if (seekable_) base_ = offset;
@@ -169,7 +171,7 @@ void ByteWindow::consume(size_t count) {
   TESSEL_INVARIANT(count <= end_ - begin_);  // the place must stay within what was read
   begin_ += count;
   place_ += count;
-  if (begin_ == end_) begin_ = end_ = 0;
+  if (begin_ == end_) begin_ = end_ = 0;  // spares the next fill() from moving anything
 }
 
 bool ByteWindow::skip(uint64_t count) {

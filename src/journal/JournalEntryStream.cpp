@@ -93,6 +93,7 @@ bool JournalEntryStream::take(uint64_t offset) {
 bool JournalEntryStream::isMarked(uint64_t offset) {
   if (!marked_->has(offset)) [[likely]]
     return false;
+  // Without the lists every further entry is looked into, so damage costs time and not entries.
   if (marked_->missed()) context_.report.addProblem("list of entries damaged", offset);
   if (!marked_->usable()) marked_.reset();
   return true;
@@ -141,6 +142,8 @@ size_t JournalEntryStream::collectTokens() {
   const size_t count = std::min(all, JournalFile::kMaxItems);
   if (all > count) context_.report.addProblem("entry with too many fields", entryOffset_);
   const uint64_t offset = entryOffset_ + kEntryItemsAt;
+  // From firstFresh_ on, so that the window holds the data objects that were written for this
+  // entry.
   const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), firstFresh_);
   if (items == nullptr) {
     context_.report.addProblem("entry damaged", entryOffset_);
@@ -164,6 +167,7 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
     const uint64_t offset = load<Item>(items + i * step);
     FieldToken token = offset <= TokenCache::kMaxOffset ? cache.find(offset) : TokenCache::kUnknown;
     if (token == TokenCache::kUnknown) [[unlikely]] {
+      // Here and not for each field: only a miss reads and decompresses, which can take long.
       if (context_.stop.load(std::memory_order_relaxed)) break;
       token = newTokenAt(offset);
     }

@@ -79,6 +79,7 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
   header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
+  // Old headers lack these. Without them the index is not used.
   if (bytes.size() >= kHeaderRead && header.headerSize >= kHeaderRead) {
     header.fieldTable = load<uint64_t>(at + kFieldTableAt);
     header.fieldTableSize = load<uint64_t>(at + kFieldTableSizeAt);
@@ -137,6 +138,8 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
   entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
   entry.bootId = loadId(at + kEntryBootAt);
   entry.contentHash = load<uint64_t>(at + kEntryHashAt);
+  // The merge and the range trust these numbers, so one beyond what a daemon writes condemns the
+  // entry.
   if (entry.sequenceNumber == 0 || entry.sequenceNumber > kMaxSequenceNumber ||
       entry.realtime == 0 || entry.realtime >= kMaxTime || entry.monotonic >= kMaxTime)
     return 0;

@@ -11,6 +11,7 @@
 #include "journal/JournalEntryStream.h"
 #include "journal/LossTokenizer.h"
 #include "journal/StoreFiles.h"
+#include "platform/Invariant.h"
 
 namespace tessel {
 
@@ -21,6 +22,7 @@ namespace {
 class SequenceWatch {
  public:
   void see(const EntryHeader& entry) {
+    // Entries of one sequence come in long rows, so the last one is tried before all are searched.
     if (last_ < seen_.size() && sameId(seen_[last_].id, entry.sequenceId)) {
       advance(seen_[last_], entry.sequenceNumber);
     } else {
@@ -57,6 +59,7 @@ class SequenceWatch {
 };
 
 void SequenceWatch::change(const EntryHeader& entry) {
+  // Numbers of no known sequence may come from many, so a gap between them means nothing.
   if (entry.sequenceId == Id128{}) return;
   const auto known = std::find_if(seen_.begin(), seen_.end(), [&](const Sequence& sequence) {
     return sequence.id == entry.sequenceId;
@@ -126,10 +129,12 @@ bool JournalStore::State::next() {
 }
 
 Entry JournalStore::State::entry() {
+  // The daemon's own words about losses are taken out here, so that users see only what they want.
   const Entry whole = merger.entry();
   return {whole.header, tokenizer.takeOwn(whole.tokens)};
 }
 
+// The report's list of files is made before the first stream: streams keep references into it.
 void JournalStore::State::openFiles(StoreFiles found) {
   facts.filesNotLookedAt = found.leftOut;
   facts.files.resize(found.files.size());
@@ -165,11 +170,13 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
     return;
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
+  // A flag that we do not know may change any layout, so nothing behind the header can be trusted.
   if (header.unknownFlags() != 0) {
     openForeign(file, header.entryCount, number);
     return;
   }
   ++usableFiles;
+  // The age of the store is known without reading the files that the range leaves out.
   if (header.headRealtime != 0) seeTime(header.headRealtime);
   if (outsideRange(header)) {
     report.skipped = "outside the range";
@@ -215,6 +222,7 @@ bool JournalStore::State::outsideRange(const JournalHeader& header) const {
 // Why the store as a whole cannot be used; nothing if it can. One file that can be read is enough:
 // what was wrong with the others is in the report.
 std::optional<PlatformError> JournalStore::State::failure(const std::string& place) const {
+  // After a stop the files were not all opened, and an empty store would be a wrong reason.
   if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
   if (facts.files.empty())
     return PlatformError{ErrorCode::notAStore,
@@ -242,6 +250,9 @@ EntryStream& JournalStore::entries() { return *state_; }
 
 StoreReport JournalStore::report() const {
   StoreReport report = state_->facts;
+  uint64_t inFiles = 0;
+  for (const FileReport& file : report.files) inFiles += file.entriesRead;
+  TESSEL_INVARIANT(inFiles == report.entriesRead);  // each delivered entry counts for one file
   report.duplicateEntries = state_->merger.duplicates();
   report.sequenceGaps = state_->sequences.gaps();
   report.missingEntries = state_->sequences.missing();

@@ -47,6 +47,7 @@ bool LossTokenizer::wants(std::string_view fieldName) const {
 }
 
 FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view value, uint64_t size) {
+  // Anyone can send this message id, so what it says is counted and shown, but decides nothing.
   if (field == kMessageId && value == kLossMessage) {
     met_ = true;
     return kLossToken;
@@ -59,6 +60,7 @@ FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view valu
 FieldToken LossTokenizer::unitToken(std::string_view name) {
   if (name.empty() || name.size() > kMaxUnitLength) return kNoToken;
   if (const auto known = unitTokens_.find(name); known != unitTokens_.end()) return known->second;
+  // No token: the entry then counts under the empty name, so the sum stays right.
   if (units_.size() > kMaxUnits) return kNoToken;
   const FieldToken token = kFirstUnit + static_cast<FieldToken>(units_.size());
   units_.push_back({std::string(name), 0});

@@ -94,6 +94,7 @@ void Finder::visit(const std::string& path, const dirent& entry, int depth) {
   }
   if (depth >= kDeepestDirectory) return;
   const int error = list(path, depth + 1);
+  // A directory that vanished was rotated away. Any other error may hide journals and is reported.
   if (error != 0 && error != ENOENT) fail(path, StoreFileKind::journal, error);
 }
 
@@ -107,6 +108,8 @@ void Finder::addFile(const std::string& path, StoreFileKind kind) {
   }
   struct stat status {};
   if (::fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return;
+  // Two names of one file, by a hard link, a symbolic one or a rename between two listings, would
+  // show all its entries twice.
   const std::pair identity(status.st_dev, status.st_ino);
   if (known_.count(identity) != 0) return;
   if (known_.size() >= limit_) {
@@ -146,8 +149,11 @@ PlatformError storeError(const std::string& path, int error) {
   return {codeOf(error), path + ": " + whyNotOpened(error)};
 }
 
+// The daemon keeps its files under /var if that directory exists, otherwise under /run. After it
+// was created, both hold a part, so both are read; one of them is enough.
 std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
   std::string machine;
+  // Other machines' journals may lie beside ours, in directories named after their ids.
   std::ifstream("/etc/machine-id") >> machine;
   if (machine.empty())
     return PlatformError{ErrorCode::notFound,
@@ -183,6 +189,7 @@ std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::
   if (!S_ISDIR(status.st_mode)) {
     if (!S_ISREG(status.st_mode))
       return PlatformError{ErrorCode::notAStore, *path + ": neither a directory nor a file"};
+    // A single file may have any name. Without a known ending it is read as a journal file.
     finder.addFile(*path, kindOf(*path).value_or(StoreFileKind::journal));
   } else if (const int error = finder.addDirectory(*path)) {
     return storeError(*path, error);
