@@ -124,8 +124,8 @@ std::string_view textAt(const uint8_t* at, size_t size) {
 }  // namespace
 
 // Walks from the table of fields to the values of the marked ones and to their lists. Every step
-// returns false if the index does not hold. All reads go past the window, which stays where the
-// entries begin.
+// returns false if the index does not hold. No read moves the window: it stays at the
+// first entry.
 class MarkedEntries::IndexReader {
  public:
   IndexReader(JournalFile& file, const StopFlag& stop) : file_(file), stop_(stop) {}
@@ -279,8 +279,8 @@ std::unique_ptr<MarkedEntries> MarkedEntries::of(JournalFile& file,
   return marked;
 }
 
-// Called only for an entry at or behind the nearest listed one. If it is behind, the list names an
-// offset where no entry was.
+// Called only for an entry at or behind the nearest listed one. If it is behind, the listed offset
+// held no entry.
 bool MarkedEntries::look(uint64_t offset) {
   missed_ = nearest_ < offset;
   usable_ = !missed_;

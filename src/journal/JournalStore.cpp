@@ -108,7 +108,7 @@ struct JournalStore::State final : EntryStream {
   const std::vector<EntryMark> marks = tokenizer.marks();
   StoreReport facts;  // streams refer to its files, so their number is set before the first stream
   size_t usableFiles = 0;
-  ErrorCode firstFailure = ErrorCode::notAStore;  // of the first file, where it is not usable
+  ErrorCode firstFailure = ErrorCode::notAStore;  // why the first file is not usable
   size_t foreignFiles = 0;                        // that journalctl reads for us
   SequenceWatch sequences;
   StoreMerger merger;

@@ -37,7 +37,7 @@ class Finder {
  public:
   Finder(size_t limit, const StopFlag& stop) : limit_(limit), stop_(stop) {}
 
-  // Lists `directory` until a listing shows nothing new; errno where it cannot be read.
+  // Lists `directory` until a listing shows nothing new. Returns 0, or errno if it cannot be read.
   int addDirectory(const std::string& directory);
   void addFile(const std::string& path, StoreFileKind kind);
   StoreFiles take();

@@ -1,5 +1,5 @@
-// What libsystemd's own reader sees in journal files, to hold ours against, and entries in a form
-// that can be compared.
+// Reads journals with libsystemd and journalctl, so that tests can compare our reader with them.
+// For tests only.
 
 #pragma once
 
@@ -32,7 +32,7 @@ class RecordingTokenizer final : public FieldTokenizer {
   uint32_t generation() const override { return 0; }
 
   const std::string& text(FieldToken token) const { return texts_.at(token - 1); }
-  // How often a text was shown.
+  // How often any text was shown.
   size_t shown() const { return shown_; }
 
  private:
@@ -42,7 +42,7 @@ class RecordingTokenizer final : public FieldTokenizer {
   size_t shown_ = 0;
 };
 
-// The rest of a stream.
+// All entries from the current place of a stream to its end.
 std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& tokenizer);
 
 // All entries of `files`, merged by libsystemd. Its entries have no content hash and no sequence.

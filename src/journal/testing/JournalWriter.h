@@ -1,6 +1,6 @@
-// JournalWriter: makes journal files of any layout in memory, for tests only: what the writers of
-// the machine that runs the tests cannot be asked for (XZ, LZ4, old headers, seals), and small
-// files to do damage to.
+// JournalWriter: makes journal files of any layout in memory, for tests only. The daemon of the
+// machine that runs the tests writes one layout; this also writes XZ, LZ4, old headers and seals.
+// Its files are small, and the offsets of their objects are known, so tests can damage them.
 
 #pragma once
 
@@ -28,14 +28,14 @@ class JournalWriter {
  public:
   explicit JournalWriter(JournalLayout layout = {});
 
-  // Appends an entry with the sequence number `header` gives, or the next one where that is 0.
+  // Appends an entry. If the sequence number of `header` is 0, it gets the next one.
   void add(EntryHeader header, const std::vector<std::string>& fields);
   // Appends `count` entries of a few fields each, some of them shared, one second apart.
   void addSome(size_t count, uint64_t firstSequence = 1);
   // The file as it stands.
   std::string bytes() const;
 
-  // Offsets of what was written, to aim at.
+  // Offsets of objects, for tests that damage them.
   const std::vector<uint64_t>& entries() const { return entries_; }
   const std::vector<uint64_t>& arrays() const { return all_.arrays; }
   uint64_t dataOf(const std::string& field) const { return data_.at(field).offset; }
