@@ -1,4 +1,7 @@
 // Counting by (subsystem, category).
+//
+// Pairs with an absent string stay out of the index, since they equal nothing and would only fill
+// it. They are rare: the extraction delivers no object without subsystem and category.
 
 #include "filter/TesselReporterAggregation.h"
 
@@ -35,11 +38,13 @@ std::string TesselReporterAggregationKey::description() const {
 }
 
 void TesselReporterAggregation::incrementSubsystem(StringRef subsystem, StringRef category) {
+  // First, so that the total holds whichever way the pair is counted.
   ++totalCount_;
   if (!bothPresent(subsystem, category)) {
     entries_.push_back({Key(subsystem, category), 1});
     return;
   }
+  // A new pair begins at 0, because the increment below is for new and known pairs alike.
   const auto add = [&] {
     entries_.push_back({Key(subsystem, category), 0});
     return static_cast<uint32_t>(entries_.size() - 1);
@@ -58,6 +63,7 @@ uint64_t TesselReporterAggregation::countForSubsystem(StringRef subsystem,
 uint64_t TesselReporterAggregation::countForKey(const Key& key) const {
   if (bothPresent(key.subsystem(), key.category()))
     return countForSubsystem(key.subsystem(), key.category());
+  // Such a key equals nothing but itself, so it is known by its place in memory.
   const auto own = std::ranges::find(entries_, &key, [](const Entry& entry) { return &entry.key; });
   return own == entries_.end() ? 0 : own->count;
 }
@@ -67,6 +73,7 @@ TesselReporterAggregation::keysInDescendingCountOrder() const {
   std::vector<const Entry*> order;
   order.reserve(entries_.size());
   for (const Entry& entry : entries_) order.push_back(&entry);
+  // Stable: of equal counts the pair that appeared first comes first, and is the one that is sent.
   std::ranges::stable_sort(order, std::ranges::greater(), &Entry::count);
 
   std::vector<const Key*> keys;

@@ -1,7 +1,7 @@
 // TesselReporterAggregation: how many trace objects each (subsystem, category) pair contributed.
 //
-// A pair is counted without copying or hashing its texts: the key takes a share of the strings it
-// is given when the pair is new, and nothing after that. At most 40 bytes per distinct pair.
+// Counting copies and hashes no text: a new pair takes a share of the strings that it is given, and
+// a known one takes nothing. An entry has 24 bytes, its place in the index 16 to 32.
 //
 // Threads: one at a time. Keys handed out are valid while the aggregation lives.
 
@@ -28,8 +28,8 @@ class TesselReporterAggregationKey {
 
   // Equal keys have equal hashes; an absent string contributes 0.
   uint64_t hash() const { return subsystem_.hash() ^ category_.hash(); }
-  // True for the very same key, and where all four strings are present and pairwise equal: a key
-  // with an absent string equals itself alone, not even its copies.
+  // True if both are the same object, or if all four strings are present and pairwise equal. So a
+  // key with an absent string does not even equal its copies.
   bool isEqual(const TesselReporterAggregationKey& other) const;
   // "subsystem/category"; an absent string reads "(null)".
   std::string description() const;
@@ -54,10 +54,10 @@ class TesselReporterAggregation {
   // Counts one object. A pair with an absent string equals no key, so each one is a new entry.
   void incrementSubsystem(StringRef subsystem, StringRef category);
 
-  // The pair's count; 0 where it has none, and for a pair with an absent string.
+  // The pair's count; 0 for a pair that was not counted or has an absent string.
   uint64_t countForSubsystem(StringRef subsystem, StringRef category) const;
-  // The count stored under a key that equals `key`; 0 where there is none. A key with an absent
-  // string has its count where it is one of this aggregation's own.
+  // The count of the key that equals `key`; 0 if there is none. A key with an absent string only
+  // finds its count if this aggregation handed it out.
   uint64_t countForKey(const Key& key) const;
   // Every key once, larger counts first; equal counts in the order in which they first appeared.
   std::vector<const Key*> keysInDescendingCountOrder() const;
@@ -77,7 +77,8 @@ class TesselReporterAggregation {
   }
   const Entry* find(StringRef subsystem, StringRef category) const;
 
-  // A deque, so that keys stay where they are and no capacity for twice the pairs lies idle.
+  // A deque, because keys that were handed out must stay where they are, and a vector would hold
+  // memory for up to twice the pairs.
   std::deque<Entry> entries_;
   FlatIndex index_;  // of the entries whose strings are present
   uint64_t totalCount_ = 0;

@@ -1,4 +1,8 @@
-// The decision and its counting.
+// The decision about an object, and its counting.
+//
+// This runs for every object of a day, so nothing here allocates, copies or hashes a text. The
+// checks stand in the order of their codes' definition: the cheapest first, and last the one that
+// changes counters, which must only see objects that passed everything else.
 
 #include "filter/TesselReporterObjectFilter.h"
 
@@ -37,7 +41,8 @@ void failSlot(const TesselObject& object, size_t slot, FilterDecision& decision)
   decision.stringValue = string.value;
 }
 
-// Says which slot of a performance-logging operation is at fault.
+// A component that is not known is at fault even if the action is not known either: the rule reads
+// the strings in that order.
 void failSpecialRule(const TesselObject& object, FilterDecision& decision) {
   decision.specialRule = true;
   const bool componentIsKnown = perfLoggingComponentSet().contains(object.string1Value());
@@ -98,7 +103,8 @@ FilterDecision TesselReporterObjectFilter::decide(const TesselSupportObject& sup
   return decision;
 }
 
-// The special rule comes before the build variant is asked, so it holds on every build.
+// The special rule comes before the build variant is asked, so it holds on internal builds, too. An
+// operation that passes it is not held against the whitelist, which mixes components and actions.
 bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& object,
                                                           FilterDecision& decision) const {
   const bool special = profile_.hasPerfLoggingRule &&

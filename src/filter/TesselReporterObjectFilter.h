@@ -1,12 +1,12 @@
 // TesselReporterObjectFilter: decides for each trace object whether it is reported, says why, and
 // counts it under exactly that reason.
 //
-// A filter serves one run: it is fed objects, and its counters are read once the run has delivered
-// them all. The downsampling filter that it points to is shared by every filter of the process and
+// A filter serves one run. It is fed objects, and its counters are read after the run has delivered
+// them all. The downsampling filter that it points to is shared by all filters of the process and
 // keeps counting from run to run.
 //
-// Threads: one at a time. Once every (subsystem, category) pair has been seen, deciding allocates
-// nothing; it never copies or hashes a text. An object that is given is borrowed for the call.
+// Threads: one at a time. A decision about a known (subsystem, category) pair allocates nothing.
+// Objects are borrowed for the call.
 
 #pragma once
 
@@ -23,20 +23,21 @@
 
 namespace tessel {
 
-// What the filter decided about one object, and what decided. Its strings are the object's; the
-// entry is the downsampling filter's and shows the counters as they are when it is read, so before
-// the next object those of this decision.
+// What the filter decided about one object, and what it decided by. Strings are borrowed from the
+// object. The downsampling entry is borrowed from its filter, and its counters are those of this
+// decision only until the next object.
 struct FilterDecision {
   TesselReporterClassification classification = TesselReporterClassificationTelemetryReported;
-  // Failed string whitelist: the slot, 1 or 2, with its label and value (each may be absent, the
-  // label under the special rule only), and whether it was the special rule that failed it.
+  // For a failed string whitelist: the slot, counted from 1, its label and its value, and whether
+  // the special rule for performance logging failed it. The value may be absent, the label only
+  // under the special rule.
   uint8_t stringSlot = 0;
   bool specialRule = false;
   StringRef stringLabel;
   StringRef stringValue;
-  // Duration threshold: the duration in seconds.
+  // For the duration threshold: the duration in seconds.
   float durationSeconds = 0;
-  // The entry that was asked, whether it let the object through or not; null where none was.
+  // The entry that was asked, whether it let the object through or not; null if none was asked.
   const TRDownsampleEntry* downsampleEntry = nullptr;
 
   bool shouldReport() const {
@@ -60,16 +61,15 @@ class TesselReporterObjectFilter {
 
   // Decides, counts, and says why.
   FilterDecision inspectTesselObject(const TesselSupportObject& object);
-  // Decides and counts: true when the object is to be reported. The classification is written where
-  // `classificationOut` is not null.
+  // The same: true if the object is to be reported. `classificationOut` may be null.
   bool shouldReportTesselObject(const TesselSupportObject& object,
                                 TesselReporterClassification* classificationOut);
-  // Counts an object under a classification; a code outside the enumeration counts as inspected and
-  // as not reported alone. Called once per decision.
+  // Counts an object under a classification. An object whose code is not in the table counts as
+  // inspected and as not reported only. Called once per decision.
   void incrementTotalForObject(const TesselSupportObject& object,
                                TesselReporterClassification classification);
 
-  // May be null, which lets every object through.
+  // May be null; then nothing is downsampled.
   const std::shared_ptr<TRSubsystemCategoryNameFilter>& scnFilter() const { return scnFilter_; }
   void setScnFilter(std::shared_ptr<TRSubsystemCategoryNameFilter> filter) {
     scnFilter_ = std::move(filter);

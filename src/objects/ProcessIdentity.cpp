@@ -1,4 +1,7 @@
 // The walk from an executable image up to its bundle.
+//
+// The walk is on the text of the path alone; the disk is asked once, about the one directory found.
+// Links are not resolved: a bundle is named after the path under which its image was started.
 
 #include "objects/ProcessIdentity.h"
 
@@ -8,6 +11,8 @@ namespace tessel {
 
 namespace {
 
+// A writer chooses the path, and a path of 4096 bytes can have 2048 directories. Real bundles lie a
+// few levels above their image.
 constexpr int kExaminedDirectoriesLimit = 100;
 
 std::string_view withoutTrailingSeparators(std::string_view path) {
@@ -17,11 +22,12 @@ std::string_view withoutTrailingSeparators(std::string_view path) {
 
 std::string_view lastComponent(std::string_view path) {
   const std::string_view trimmed = withoutTrailingSeparators(path);
-  // Where there is no separator rfind() gives npos, and that plus 1 is 0.
+  // Without a separator, rfind() answers npos, and npos + 1 is 0.
   return trimmed.substr(trimmed.rfind('/') + 1);
 }
 
-// "/" for a path directly below the root, and empty for a single relative component.
+// "/" for a path directly below the root. Empty for a single relative component, which has no
+// parent that we could know.
 std::string_view parent(std::string_view path) {
   const std::string_view trimmed = withoutTrailingSeparators(path);
   const size_t separator = trimmed.rfind('/');
@@ -30,11 +36,13 @@ std::string_view parent(std::string_view path) {
   return above.empty() ? path.substr(0, 1) : above;
 }
 
-// The nearest directory above the image that is named after it; empty where there is none.
+// The nearest directory above the image that is named after it, "Foo.app" for "Foo"; empty if there
+// is none. A directory called "Foo" alone is no bundle, hence the dot.
 std::string_view bundleDirectoryAbove(std::string_view imagePath) {
   const std::string prefix = std::string(lastComponent(imagePath)) + ".";
   std::string_view directory = parent(imagePath);
   for (int examined = 0; examined < kExaminedDirectoriesLimit; ++examined) {
+    // The parent of "/" is "/", so the walk would never end by itself.
     if (directory.empty() || directory == "/") return {};
     if (lastComponent(directory).starts_with(prefix)) return directory;
     directory = parent(directory);
@@ -48,6 +56,8 @@ SharedString ProcessIdentity::bundleIdentifierForImagePath(StringRef imagePath) 
   if (!imagePath.present()) return {};
   const auto known = bundleIdentifierCache_.find(imagePath);
   if (known != bundleIdentifierCache_.end()) return known->second;
+  // A path without a bundle is kept as well. Most processes have none, and each of their objects
+  // would otherwise cost a walk and a look at the disk.
   return bundleIdentifierCache_.emplace(imagePath, search(imagePath.text())).first->second;
 }
 

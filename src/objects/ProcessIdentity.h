@@ -1,8 +1,9 @@
-// ProcessIdentity: from the path of an executable image to the identifier of its bundle.
+// ProcessIdentity: finds the bundle identifier of an executable image.
 //
-// The bundle is the nearest directory above the image, within 100 levels, whose name begins with
-// the image's file name and a dot. Every answer, found or not, is kept for the life of the object,
-// so a path costs one walk and at most one bundle lookup, ever.
+// The bundle of an image is the nearest directory above it, within 100 levels, whose name begins
+// with the image's file name and a dot. Every answer is kept for the life of the object, "none"
+// included, so a path costs one walk and at most one bundle lookup. A bundle that is installed or
+// removed later changes nothing for a path that was asked before.
 //
 // Threads: one at a time.
 
@@ -20,8 +21,8 @@ class ProcessIdentity {
  public:
   explicit ProcessIdentity(BundleReader& bundles) : bundles_(bundles) {}
 
-  // The bundle identifier for the image at `imagePath`; absent where there is none. Touches the
-  // file system only for a path that was not asked for before.
+  // Absent if the image has no bundle or the path is absent. Touches the file system only for a
+  // path that it was not asked for before.
   SharedString bundleIdentifierForImagePath(StringRef imagePath);
 
  private:
@@ -35,7 +36,7 @@ class ProcessIdentity {
   };
 
   BundleReader& bundles_;
-  // Image path to identifier; an absent identifier marks a path that has none.
+  // Image path to identifier. An absent identifier marks a path that has none.
   std::unordered_map<SharedString, SharedString, Hash, Equal> bundleIdentifierCache_;
 };
 

@@ -1,14 +1,13 @@
-// The trace objects: what the extraction service delivers, one class per kind.
+// The trace objects that the extraction service delivers, one class per kind.
 //
 //   TesselSupportObject -> TesselObject -> TesselEvent
 //                                       -> TesselInterval -> TesselAnimationInterval
 //
-// Objects are immutable after delivery and shared by reference count; any thread may read them.
-// Their strings are borrowed from the string pool of the extraction, which each object keeps
-// alive. A string property may be absent.
+// Objects are immutable and shared by reference count; any thread may read them. Their strings are
+// borrowed from the string pool of the extraction, which each object keeps alive. A string property
+// may be absent.
 //
-// The last three operations of each class are what the service adds to it for reporting; a class
-// that does not define one inherits that of the class it is derived from.
+// Reporting asks an object for its tesselType(), canGenerateStatoraPayload() and statoraPayload().
 
 #pragma once
 
@@ -36,7 +35,8 @@ class TesselSupportObject {
   TesselSupportObject& operator=(const TesselSupportObject&) = delete;
   virtual ~TesselSupportObject() = default;
 
-  // Membership by derivation: an animation interval is also an interval and an object.
+  // Also true for a class that the object's class derives from: an animation interval is an
+  // interval and an object, too.
   bool isKindOf(TesselClass wanted) const;
 
   virtual bool canGenerateStatoraPayload() const { return false; }
@@ -50,7 +50,7 @@ class TesselSupportObject {
   const TesselClass class_ = TesselClass::supportObject;
 };
 
-// Arguments that a writer labels. A value counts only where its label is present.
+// Arguments to which a writer gives a label. A value without a label is never sent.
 struct LabelledString {
   StringRef label;
   StringRef value;
@@ -109,7 +109,7 @@ class TesselObject : public TesselSupportObject {
   const TracePointFields fields_;
 };
 
-// The process that emitted an event.
+// The process that emitted an event. Either may be absent.
 struct EmittingProcess {
   StringRef imagePath;  // of the executable
   StringRef name;
@@ -131,8 +131,8 @@ class TesselEvent final : public TesselObject {
   const EmittingProcess process_;
 };
 
-// What an interval carries beyond a trace point. Of the events that opened and closed it, the
-// processes are kept.
+// What an interval carries beyond a trace point. The processes that opened and closed it may be
+// two.
 struct IntervalFields {
   EmittingProcess beginEvent;
   EmittingProcess endEvent;
@@ -147,7 +147,7 @@ class TesselInterval : public TesselObject {
 
   const EmittingProcess& beginEvent() const { return interval_.beginEvent; }
   const EmittingProcess& endEvent() const { return interval_.endEvent; }
-  // The attribute's value; absent where there is none under `key`.
+  // The value of the attribute `key`; absent if the interval has no such attribute.
   StringRef attribute(std::string_view key) const;
 
   std::string_view tesselType() const override { return "Interval"; }

@@ -1,13 +1,20 @@
 // Sections, run-summary event, closing line.
+//
+// Headings, payload keys and the closing line are an interface that other programs read. Their
+// texts stay as they are, line breaks included.
 
 #include "summary/RunSummary.h"
 
+#include "platform/Invariant.h"
 #include "platform/Log.h"
-#include "summary/CountEvents.h"
 
 namespace tessel {
 
 namespace {
+
+// A day can have thousands of pairs, and the spool takes a row for each event. Those that are
+// counted most tell most, and the log has all of them.
+constexpr uint64_t kSentPerSection = 5;
 
 struct Section {
   LogFormat<uint64_t> header;  // takes the aggregation's total
@@ -32,6 +39,16 @@ constexpr Section kSections[] = {
      &Filter::telemetryNotReportedFailedStringWhitelistAggregation, "StringWhitelistFiltered"},
 };
 
+Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count,
+                     std::string_view classification) {
+  Payload payload;
+  payload.set("Subsystem", key.subsystem());
+  payload.set("Category", key.category());
+  payload.set("Count", Number{count});
+  payload.set("Classification", SharedString(classification));
+  return payload;
+}
+
 Payload runSummaryPayload(const TesselReporterObjectFilter& filter,
                           const TesselSupportObjectExtractor& extractor, float seconds,
                           bool interrupted) {
@@ -50,6 +67,22 @@ Payload runSummaryPayload(const TesselReporterObjectFilter& filter,
 
 }  // namespace
 
+uint64_t CountReporter::reportCountForKey(const TesselReporterAggregationKey& key,
+                                          const TesselReporterAggregation& aggregation) {
+  // Also for a key that is only logged: the pace of a section does not depend on what it sends.
+  throttle_.throttleReportedEvent();
+  const uint64_t count = aggregation.countForKey(key);
+  if (sentCount_ == kSentPerSection) {
+    tesselReporterLog().debug("%@:\t%llu (Count not reported)", key, count);
+    return count;
+  }
+  sender_.sendEvent("com.vantor.performance.tessel_counts",
+                    countPayload(key, count, classification_));
+  ++sentCount_;
+  tesselReporterLog().debug("%@:\t%llu (Count reported to Statora)", key, count);
+  return count;
+}
+
 uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
                                       const TesselSupportObjectExtractor& extractor, Date startDate,
                                       Date endDate, const std::atomic<bool>& interruptedByDeferral,
@@ -59,6 +92,7 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
                     runSummaryPayload(filter, extractor, seconds, interruptedByDeferral));
   const LogHandle& log = tesselReporterLog();
+  // Formatting two dates costs more than all the counts, so it is not done for nobody.
   if (log.isEnabled(LogLevel::debug)) {
     log.debug(
         "Done processing %llu reported and %llu unreported events, %llu reported and %llu "
@@ -84,27 +118,29 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
 }
 
 uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
-  CountReporter counts(sender_, throttle_);
+  uint64_t sent = 0;
   for (const Section& section : kSections) {
     const TesselReporterAggregation& aggregation = (filter.*section.aggregation)();
     tesselReporterLog().debug(section.header, aggregation.totalCount());
-    counts.beginSection();
+    CountReporter counts(sender_, throttle_, section.classification);
+    uint64_t counted = 0;
     for (const TesselReporterAggregationKey* key : aggregation.keysInDescendingCountOrder()) {
-      status_.progress();
-      counts.reportCountForKey(*key, aggregation, section.classification);
+      status_.progress();  // a section may take minutes; the service manager must see it alive
+      counted += counts.reportCountForKey(*key, aggregation);
     }
+    // What the heading says is the sum of the lines below it.
+    TESSEL_INVARIANT(counted == aggregation.totalCount());
+    sent += counts.sentCount();
   }
-  return counts.sentCount();
+  return sent;
 }
 
 float RunSummary::secondsSince(uint64_t startTime) {
   const uint64_t endTime = clock_.continuousTicks();
-  std::call_once(factorMade_, [this] {
-    const Timebase timebase = clock_.timebase();
-    secondsPerTick_ =
-        static_cast<double>(timebase.numerator) * 1e-9 / static_cast<double>(timebase.denominator);
-  });
-  return static_cast<float>(static_cast<double>(endTime - startTime) * secondsPerTick_);
+  const Timebase timebase = clock_.timebase();
+  const double secondsPerTick =
+      static_cast<double>(timebase.numerator) * 1e-9 / static_cast<double>(timebase.denominator);
+  return static_cast<float>(static_cast<double>(endTime - startTime) * secondsPerTick);
 }
 
 }  // namespace tessel

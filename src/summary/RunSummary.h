@@ -1,15 +1,16 @@
 // RunSummary: the books of a run, at its end.
 //
-// Six sections of counts in the log, up to five count events each, one run-summary event, the
-// closing line, and the throttle's totals where it ever slept. Runs as one job on the reporting
-// queue, after every send of the run and after the extraction has returned. One object serves the
-// whole process.
+// It logs six sections of counts and sends up to five count events for each, then sends one
+// run-summary event and logs the closing line, and the throttle's totals if it ever slept.
+//
+// Threads: a summary is one job on the reporting queue, submitted after every send of the run and
+// after the extraction has returned. One object serves the whole process.
 
 #pragma once
 
 #include <atomic>
 #include <cstdint>
-#include <mutex>
+#include <string_view>
 
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
@@ -18,6 +19,25 @@
 
 namespace tessel {
 
+// Handles the keys of one section: an event for each of the first five, a log line for every one.
+class CountReporter {
+ public:
+  CountReporter(EventSender& sender, Throttle& throttle, std::string_view classification)
+      : sender_(sender), throttle_(throttle), classification_(classification) {}
+
+  // Answers the key's count. REQUIRES: `aggregation` holds `key`.
+  uint64_t reportCountForKey(const TesselReporterAggregationKey& key,
+                             const TesselReporterAggregation& aggregation);
+  // Events sent so far.
+  uint64_t sentCount() const { return sentCount_; }
+
+ private:
+  EventSender& sender_;
+  Throttle& throttle_;
+  const std::string_view classification_;
+  uint64_t sentCount_ = 0;
+};
+
 class RunSummary {
  public:
   RunSummary(EventSender& sender, Throttle& throttle, Clock& clock, DateFormatter& dates,
@@ -25,8 +45,8 @@ class RunSummary {
       : sender_(sender), throttle_(throttle), clock_(clock), dates_(dates), status_(status) {}
 
   // `startDate` and `endDate` bound the period that was read; `processingStartTime` is in ticks of
-  // the continuous clock. `interruptedByDeferral` may still change while the summary runs.
-  // Answers how many count events it sent.
+  // the continuous clock. `interruptedByDeferral` may change while the summary runs, because the
+  // deferral poll does not stop for it. Answers how many count events were sent.
   uint64_t reportRunSummary(const TesselReporterObjectFilter& filter,
                             const TesselSupportObjectExtractor& extractor, Date startDate,
                             Date endDate, const std::atomic<bool>& interruptedByDeferral,
@@ -41,8 +61,6 @@ class RunSummary {
   Clock& clock_;
   DateFormatter& dates_;
   ServiceStatus& status_;
-  std::once_flag factorMade_;
-  double secondsPerTick_ = 0;
 };
 
 }  // namespace tessel

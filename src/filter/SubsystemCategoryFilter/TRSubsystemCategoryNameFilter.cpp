@@ -1,4 +1,8 @@
 // The downsampling tree: tiers, entries and the configuration they are built from.
+//
+// A tree of hash tables makes a decision cost three look-ups at most, however many rows there are.
+// A list of rows would be searched in full for each object that none of them concerns, which is
+// most.
 
 #include "filter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter.h"
 
@@ -15,15 +19,18 @@ namespace tessel {
 
 namespace {
 
-// Stops the process over an operation that a tier should have defined.
+// Ends the process over an operation that a tier should have defined: a mistake in our own code.
+// Text, file and line are an interface that other programs read, so they do not follow this source
+// file.
 [[noreturn]] void failAbstractOperation(const char* function, int line) {
   std::fprintf(stderr, "Assertion failed: (false), function %s, file %s, line %d.\n", function,
                "tessel_reporter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter", line);
   std::abort();
 }
 
-// The number as an unsigned 64-bit integer: wrapped where it is a negative integer, cut off and
-// held within bounds where it is floating point.
+// The number as an unsigned 64-bit integer. A negative integer wraps around, so -1 is a cap that is
+// never reached. Floating point loses its fraction and is held within bounds, because a conversion
+// from outside of them is undefined; the comparison is written so that NaN becomes 0.
 uint64_t unsignedValue(const Number& number) {
   return std::visit(
       [](auto value) -> uint64_t {
@@ -66,6 +73,7 @@ bool TRDownsampleEntry::shouldReportThisTime() {
   const uint64_t seen = eventsSeen() + 1;
   setEventsSeen(seen);
   const uint64_t reported = eventsReported();
+  // An object beyond the cap still counts as seen: the ratio is one of all objects.
   if (reported >= cap_ || seen % downsampleRatio_ != 0) return false;
   setEventsReported(reported + 1);
   return true;
@@ -73,6 +81,7 @@ bool TRDownsampleEntry::shouldReportThisTime() {
 
 TRDownsampleEntry* FilterTier::entryForQuery(const FilterQuery& query) const {
   const StringRef key = keyForChildren(query);
+  // A child without an entry on the path does not decide, and this tier's own entry applies.
   if (key.present()) {
     const auto child = childTiers_->find(key);
     if (child != childTiers_->end()) {

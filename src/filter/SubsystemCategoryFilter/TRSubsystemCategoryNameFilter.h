@@ -5,11 +5,11 @@
 //                                                                 --name--> FilterNameTier
 //
 // A tier may carry a TRDownsampleEntry. The most specific entry on an object's path through the
-// tree decides; where the path has none, the object is let through. Only the entries' counters
-// change once a filter is built, and they count for as long as it lives.
+// tree decides; an object whose path has none is let through. Once a filter is built, only the
+// counters of its entries change, and they count for as long as the filter lives.
 //
-// Threads: a filter is used by one at a time. An entry's counters may be read from any thread.
-// Asking copies and hashes no text.
+// Threads: one at a time uses a filter; any thread may read the counters of an entry. Asking copies
+// and hashes no text.
 
 #pragma once
 
@@ -27,7 +27,7 @@
 
 namespace tessel {
 
-// The path that the tree is walked along. Borrows its strings; each may be absent.
+// The path of an object through the tree. Borrows its strings; each may be absent.
 class FilterQuery {
  public:
   FilterQuery(StringRef subsystem, StringRef category, StringRef name)
@@ -46,10 +46,10 @@ class FilterQuery {
 // Lets through each object whose running number is a multiple of the ratio, up to a cap.
 class TRDownsampleEntry {
  public:
-  // Nothing where the ratio is 0, which is logged. A cap of 0 lets nothing through.
+  // Null and a log line for a ratio of 0. A cap of 0 lets nothing through.
   static std::unique_ptr<TRDownsampleEntry> initWithCap(uint64_t cap, uint64_t downsampleRatio);
 
-  // Whether the object at hand is let through. Counts it as seen, and as reported where it is.
+  // Whether the next object is let through. Counts it as seen and, if so, as reported.
   bool shouldReportThisTime();
 
   // Objects that this entry was asked about.
@@ -90,16 +90,16 @@ class FilterTier {
   FilterTier& operator=(const FilterTier&) = delete;
   virtual ~FilterTier() = default;
 
-  // The entry for the query here or below; null where there is none. Borrowed until it is replaced.
+  // The entry for the query in this tier or below; null if there is none. Borrowed until replaced.
   TRDownsampleEntry* entryForQuery(const FilterQuery& query) const;
-  // Puts a fresh entry where the walk meets the query's first absent string, in place of the one
-  // that is there; a ratio of 0 leaves none.
+  // Puts a fresh entry into the tier where the query's first string is absent. It replaces the
+  // entry there; a ratio of 0 leaves none.
   void setCap(uint64_t cap, uint64_t downsampleRatio, const FilterQuery& query);
 
-  // The key under which this tier files a query's child; absent where it has no children. Stops the
-  // process in a class that does not say.
+  // The string of the query that chooses the child; absent in a leaf. Stops the process in a class
+  // that does not define it.
   virtual StringRef keyForChildren(const FilterQuery& query) const;
-  // A tier of the next level. Stops the process in a class that has no next level.
+  // A tier of the next level. Stops the process in a leaf.
   virtual std::unique_ptr<FilterTier> newChildInstance() const;
 
   // Null in a leaf.
@@ -147,20 +147,20 @@ class FilterNameTier final : public FilterTier {
   StringRef keyForChildren(const FilterQuery&) const override { return {}; }
 };
 
-// One dictionary per entry: "Subsystem", "Cap" and "DownsampleRatio", and where wanted "Category"
-// and "Name". A value of another type than string or number is taken for absent.
+// One dictionary per entry: "Subsystem", "Cap" and "DownsampleRatio", optionally "Category" and
+// "Name". A value of the wrong type is taken for absent.
 using DownsampleConfiguration = std::vector<ConfigurationValue::Dictionary>;
 
 class TRSubsystemCategoryNameFilter {
  public:
-  // Nothing for an absent configuration, and for one with a row that lacks a required value, which
-  // is logged; later rows are not read then. A row with a ratio of 0 makes no entry.
+  // Null for an absent configuration. Null and a log line for a row that lacks a required value;
+  // the rows after it are not read. A row with a ratio of 0 makes no entry.
   static std::shared_ptr<TRSubsystemCategoryNameFilter> initWithDictionaryArray(
       const std::optional<DownsampleConfiguration>& configuration);
 
   // True when the object may be reported. Advances the counters of the entry that applies to it.
   bool shouldReportObject(const TesselObject& object);
-  // The entry that applies to the object; null where there is none. Borrowed until it is replaced.
+  // The entry that applies to the object; null if there is none. Borrowed until replaced.
   TRDownsampleEntry* downsampleEntryForObject(const TesselObject& object) const;
   // Puts a fresh entry at the path; its strings may be absent. See FilterTier::setCap().
   void addEntryWithSubsystem(StringRef subsystem, StringRef category, StringRef name, uint64_t cap,
@@ -175,7 +175,7 @@ class TRSubsystemCategoryNameFilter {
   const std::unique_ptr<FilterTier> filterTreeRoot_;
 };
 
-// The downsampling that the platform's profile holds; nothing where it downsamples nothing.
+// The downsampling of the platform's profile; absent if that downsamples nothing.
 std::optional<DownsampleConfiguration> defaultConfigurationForPlatform(
     TesselReporterPlatform platform);
 
