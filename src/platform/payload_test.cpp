@@ -9,7 +9,7 @@
 namespace tessel {
 namespace {
 
-TEST(PayloadTest, KeysKeepTheirOrderAndAbsentOnesAreLeftOut) {
+TEST(PayloadTest, KeysKeepTheirOrderWithoutAbsentOnes) {
   Payload payload;
   payload.set("B", SharedString("two"));
   payload.set("A", Number{true});

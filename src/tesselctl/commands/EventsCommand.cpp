@@ -71,7 +71,7 @@ class RowSelection {
   const std::optional<Period> period_;
 };
 
-std::string jsonLine(const SpoolRow& row) {
+std::string rowJson(const SpoolRow& row) {
   return objectLine([&](JsonWriter& json) {
     json.member("id", row.id).member("time", row.time).member("name", row.name);
     if (Json::accept(row.payload))
@@ -163,7 +163,7 @@ class EventsRun {
     const bool limited = options_.newest != 0;
     const bool read = spool_.readNew([&](const SpoolRow& row) {
       if (!selection_.wants(row)) return true;
-      std::string line = options_.json ? jsonLine(row) : humanLine(row, terminal_);
+      std::string line = options_.json ? rowJson(row) : humanLine(row, terminal_);
       if (!limited || followed_) {
         print(line);
         return true;

@@ -1,4 +1,8 @@
 // Parsing and writing dates.
+//
+// The parser is written by hand. The C library's follows the locale and takes "2026-02-30" for a
+// day in March: a mistyped period would be answered with the figures of another one. Here a text is
+// a date from its first to its last character, or it is none.
 
 #include "tesselctl/reading/TimeArguments.h"
 
@@ -17,6 +21,8 @@ using std::chrono::microseconds;
 using std::chrono::seconds;
 
 constexpr microseconds kDay = std::chrono::hours{24};
+// A thousand years. Any date minus that is far within what 64 bits of microseconds hold, so no sum
+// below can overflow.
 constexpr microseconds kLongest = std::chrono::hours{24 * 365'000};
 
 // Reads what it is asked for from the front of a text.
@@ -35,7 +41,8 @@ class Scanner {
     while (skip(' ')) {
     }
   }
-  // A decimal number of `fewest` to `most` digits.
+  // A decimal number of `fewest` to `most` digits. Nobody asks for more than 12 digits, which
+  // always fit 64 bits.
   std::optional<int64_t> number(size_t fewest, size_t most) {
     size_t digits = 0;
     while (digits < rest_.size() && digits < most && isDigit(rest_[digits])) ++digits;
@@ -46,7 +53,8 @@ class Scanner {
     rest_.remove_prefix(digits);
     return value;
   }
-  // The part of a second behind a point; digits beyond microseconds are passed over.
+  // The part of a second behind a point. Digits beyond microseconds are read and dropped, since
+  // other tools print nanoseconds.
   std::optional<microseconds> fraction() {
     microseconds value{0};
     microseconds unit{100'000};
@@ -80,12 +88,16 @@ std::tm localParts(Date date) {
   return parts;
 }
 
+// The day is moved in the calendar and not by 24 hours: a day has 23 or 25 hours when the clocks
+// change. fromLocal() takes a day 0 as the last of the month before.
 std::tm midnight(std::tm parts, int dayOffset) {
   parts.tm_hour = parts.tm_min = parts.tm_sec = 0;
   parts.tm_mday += dayOffset;
   return parts;
 }
 
+// Whether summer time is in force at that date is for the zone to say, hence -1: the parts may come
+// from `now`, which may be in the other half of the year.
 Date fromLocal(std::tm parts) {
   parts.tm_isdst = -1;
   return Date{seconds{std::mktime(&parts)}};
@@ -117,6 +129,7 @@ bool readTime(Scanner& scanner, CalendarDate& date) {
   date.parts.tm_hour = static_cast<int>(*hour);
   date.parts.tm_min = static_cast<int>(*minute);
   if (!scanner.skip(':')) return true;
+  // The system's clock never shows a second 60, so a text that does is a mistake.
   const auto second = scanner.number(2, 2);
   if (!second || *second > 59) return false;
   date.parts.tm_sec = static_cast<int>(*second);
@@ -126,7 +139,7 @@ bool readTime(Scanner& scanner, CalendarDate& date) {
   return fraction.has_value();
 }
 
-// "Z" or "+01:00": the offset from UTC.
+// "Z", "+01:00" or "+0100": the offset from UTC. No zone is farther ahead than 14 hours.
 std::optional<seconds> readZone(Scanner& scanner) {
   if (scanner.skip('Z')) return seconds{0};
   const int sign = scanner.peek() == '-' ? -1 : 1;
@@ -141,6 +154,7 @@ std::optional<seconds> readZone(Scanner& scanner) {
 std::optional<Date> parseCalendar(std::string_view text, Date now) {
   CalendarDate date;
   Scanner scanner(text);
+  // A year has four digits, so a colon behind two means a time of today.
   if (text.size() > 2 && text[2] == ':') {
     date.parts = midnight(localParts(now), 0);
     if (!readTime(scanner, date) || !scanner.done()) return {};
@@ -187,6 +201,7 @@ std::optional<microseconds> unitNamed(std::string_view word) {
   return {};
 }
 
+// Takes `suffix` off the end of `text`; false if it is not there.
 bool eatSuffix(std::string_view& text, std::string_view suffix) {
   if (!text.ends_with(suffix)) return false;
   text.remove_suffix(suffix.size());
@@ -207,6 +222,8 @@ std::string formatted(Date date, const char* format) {
 
 }  // namespace
 
+// Each part is checked before it is multiplied, the sum after each part: "999999999999w" must be no
+// duration rather than a number that went round.
 std::optional<microseconds> parseDuration(std::string_view text) {
   Scanner scanner(text);
   microseconds total{0};
@@ -240,6 +257,8 @@ std::optional<Date> parseDate(std::string_view text, Date now) {
 std::string dateText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S"); }
 std::string timeOfDayText(Date date) { return formatted(date, "%H:%M:%S"); }
 
+// Whole units of one or two sizes: who reads how long ago a run was does not want its seconds. Up
+// to two days are said in hours, since "1 days" says too little about a service that runs daily.
 std::string durationText(microseconds duration) {
   const auto whole = std::chrono::floor<seconds>(duration).count();
   if (whole < 60) return std::to_string(whole) + " s";
@@ -252,6 +271,8 @@ std::string durationText(microseconds duration) {
   return std::to_string(whole / 86'400) + " days";
 }
 
+// --until sets the end and, alone, the day before it; --last sets the length back from the end;
+// --since sets the start. So --since and --last contradict each other, all else combines.
 PeriodResult periodOf(const PeriodArguments& arguments, Date now) {
   static constexpr char kDates[] =
       "is no date; dates look like 2026-11-22, '2026-11-22 21:45', 21:45, yesterday, -24h or '2 "

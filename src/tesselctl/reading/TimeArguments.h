@@ -6,8 +6,8 @@
 //   @1795379995            seconds since 1970
 //   -24h   24h ago   1h30m ago   2 days ago
 //
-// Without a zone a date is local time. Durations: a number and s, m, h, d or w, or the words for
-// them; several parts add up. Stateless; any thread.
+// A date without a zone is local time. A duration is a number and s, m, h, d or w, or the words for
+// them; several parts add up. Stateless; any thread, as long as none changes the time zone.
 
 #pragma once
 
@@ -20,9 +20,9 @@
 
 namespace tessel::ctl {
 
-// The date that `text` names, seen from `now`; nothing where it names none.
+// The date that `text` names, seen from `now`; nothing if it names none.
 std::optional<Date> parseDate(std::string_view text, Date now);
-// Nothing where `text` is no duration, is zero, or is over a thousand years.
+// Nothing if `text` is no duration, or one of zero or of more than a thousand years.
 std::optional<std::chrono::microseconds> parseDuration(std::string_view text);
 
 // "2026-11-22 21:45:01", local time.
@@ -32,14 +32,13 @@ std::string timeOfDayText(Date date);
 // "3 s", "5 min", "2 h 10 min", "4 days".
 std::string durationText(std::chrono::microseconds duration);
 
-// [start, end)
 struct Period {
   Date start;
-  Date end;
+  Date end;  // not in the period
   std::chrono::microseconds length() const { return end - start; }
 };
 
-// What --since, --until and --last say; empty where they are not given.
+// The values of --since, --until and --last; empty if the option is not given.
 struct PeriodArguments {
   std::string since;
   std::string until;
@@ -48,11 +47,11 @@ struct PeriodArguments {
   bool given() const { return !since.empty() || !until.empty() || !last.empty(); }
 };
 
-// The period; without arguments the 24 hours before `now`. The error names argument and value.
 struct PeriodResult {
   std::optional<Period> period;
-  std::string error;
+  std::string error;  // names the option and its value, fit for a terminal; empty with a period
 };
+// The period that the arguments name. Without arguments it is the 24 hours before `now`.
 PeriodResult periodOf(const PeriodArguments& arguments, Date now);
 
 }  // namespace tessel::ctl

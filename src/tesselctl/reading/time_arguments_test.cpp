@@ -26,7 +26,7 @@ class TimeArgumentsTest : public ::testing::Test {
   const Date now{seconds{1'795'383'930}};
 };
 
-TEST_F(TimeArgumentsTest, DatesAreReadInEveryFormThatIsPromised) {
+TEST_F(TimeArgumentsTest, DatesAreReadInEveryPromisedForm) {
   const struct {
     const char* text;
     int64_t secondsBeforeNow;
@@ -77,7 +77,7 @@ TEST_F(TimeArgumentsTest, WhatIsNoDateIsNone) {
   }
 }
 
-TEST_F(TimeArgumentsTest, DurationsNeedAUnitAndAreMoreThanNothing) {
+TEST_F(TimeArgumentsTest, DurationsNeedAUnit) {
   EXPECT_EQ(parseDuration("1h30m"), std::chrono::minutes{90});
   EXPECT_EQ(parseDuration("2 days 1 second"), std::chrono::hours{48} + seconds{1});
   for (const char* text :
@@ -86,7 +86,7 @@ TEST_F(TimeArgumentsTest, DurationsNeedAUnitAndAreMoreThanNothing) {
   }
 }
 
-TEST_F(TimeArgumentsTest, APeriodIsTheLastDayUnlessToldOtherwise) {
+TEST_F(TimeArgumentsTest, APeriodIsADayUnlessToldOtherwise) {
   const auto period = [&](const PeriodArguments& arguments) {
     return periodOf(arguments, now).period;
   };

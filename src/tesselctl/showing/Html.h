@@ -1,7 +1,8 @@
-// Html: markup that is put together piece by piece and cannot be injected into.
+// Html: markup that is put together piece by piece.
 //
-// Only literals of this program are markup; every other text is escaped on its way in, whoever
-// wrote it. One thread at a time.
+// Only literals of this program become markup, because their type tells them apart: a literal is an
+// array of known length. Every other text is escaped on its way in, whoever wrote it, so that
+// forgetting to escape is not possible. One thread at a time.
 
 #pragma once
 
@@ -25,7 +26,7 @@ class Html {
     return *this;
   }
   Html& operator<<(const std::string& text) { return *this << std::string_view(text); }
-  // A count, in groups of three digits for people and plain for programs.
+  // A count: in groups of three digits for people, plain in an attribute for programs.
   Html& operator<<(uint64_t count) {
     text_.append("<data value=\"")
         .append(std::to_string(count))
@@ -38,7 +39,7 @@ class Html {
     text_ += part.text_;
     return *this;
   }
-  // A coordinate or a size in a drawing.
+  // A coordinate or a size in a drawing, with two decimals.
   Html& at(double value);
 
   const std::string& text() const { return text_; }

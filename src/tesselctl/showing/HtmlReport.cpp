@@ -1,4 +1,8 @@
 // Writing the report page.
+//
+// The charts are drawn here, as SVG, and not by a script in the page. The page holds what programs
+// recorded, and some of that may be meant to run. A page that may run nothing is safe to open. The
+// price is that a chart only answers the pointer, with the titles of its parts.
 
 #include "tesselctl/showing/HtmlReport.h"
 
@@ -25,11 +29,15 @@ Html& Html::at(double value) {
 
 namespace {
 
+// People read the page. Whoever needs every pair and value takes `explain --summary --json`.
 constexpr size_t kPairsOnPage = 40;
 constexpr size_t kMissesOnPage = 60;
+// Drawings have units of their own and are stretched to the width of the page.
 constexpr double kChartWidth = 1000;
 constexpr double kChartHeight = 200;
 
+// Escaping already keeps recorded text from becoming markup. The policy is the second line: should
+// markup slip through one day, the browser still loads and runs nothing.
 constexpr char kPolicy[] =
     "<meta http-equiv=\"Content-Security-Policy\" content=\"default-src 'none'; style-src "
     "'unsafe-inline'\">\n";
@@ -38,6 +46,7 @@ double ratio(uint64_t part, uint64_t whole) {
   return whole == 0 ? 0 : static_cast<double>(part) / static_cast<double>(whole);
 }
 
+// One object of a million is not none, so something is never shown as "0.0 %".
 std::string percent(uint64_t part, uint64_t whole) {
   if (whole == 0) return "0 %";
   const double share = ratio(part, whole) * 100;
@@ -53,7 +62,7 @@ std::string title(TesselReporterClassification verdict) {
   return words;
 }
 
-// "12 reported, 3 downsampled", for a text alternative.
+// "12 reported, 3 downsampled": what a chart says to those who cannot see it.
 std::string spoken(const VerdictCounts& counts) {
   std::string words;
   for (const auto verdict : kVerdictOrder) {
@@ -64,7 +73,7 @@ std::string spoken(const VerdictCounts& counts) {
   return words.empty() ? "none" : words;
 }
 
-// A bar of all verdicts, `scale` wide of a whole of 1,000.
+// A bar of all verdicts, `scale` units wide.
 Html bar(const VerdictCounts& counts, double scale) {
   Html html;
   const uint64_t total = sumOf(counts);
@@ -126,7 +135,8 @@ Html verdictSection(const Tally& tally) {
   return html << "</table></div>\n</section>\n";
 }
 
-// The least round number that is not below `highest`.
+// The least round number that is not below `highest`. The steps are so close that the highest
+// column fills at least half of the chart.
 uint64_t roundTop(uint64_t highest) {
   for (uint64_t unit = 1;; unit *= 10) {
     for (const uint64_t step : {1U, 2U, 3U, 4U, 5U, 6U, 8U}) {

@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <numeric>
 
+#include "platform/Invariant.h"
 #include "platform/Text.h"
 
 namespace tessel::ctl {
@@ -61,6 +62,8 @@ std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
     characters.push_back(character.bytes);
     widths.push_back(widthOf(character.point));
   });
+  // The ellipsis takes one column. A mark of no width behind the cut stays with its letter, since
+  // fitting() takes all that fits; one at the start of the tail may lose its letter.
   const size_t head = fitting(widths, width - 1 - tailWidth);
   std::reverse(widths.begin(), widths.end());
   const size_t tail = fitting(widths, tailWidth);
@@ -71,6 +74,7 @@ std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
   return out;
 }
 
+// $NO_COLOR counts if it holds anything, whatever that is: this is how other programs read it.
 bool coloursWanted() {
   const char* refused = std::getenv("NO_COLOR");
   if (refused != nullptr && *refused != '\0') return false;
@@ -78,6 +82,8 @@ bool coloursWanted() {
   return kind != nullptr && *kind != '\0' && std::string_view(kind) != "dumb";
 }
 
+// Colours by their place in the terminal's palette, not by value: whoever set up the terminal chose
+// that palette so that it can be read on its background.
 std::string_view sequenceOf(Colour colour) {
   switch (colour) {
     case Colour::good:
@@ -96,7 +102,9 @@ std::string_view sequenceOf(Colour colour) {
   return "";
 }
 
+// The last column gets no padding: a line that is copied from a terminal should end with its text.
 std::string fitted(std::string_view text, size_t width, Table::Align align, bool last) {
+  // A character of two columns may leave one column over, so the padding comes from what was taken.
   std::string shown = shortened(text, width);
   const size_t taken = displayWidth(shown);
   const std::string padding(width - std::min(taken, width), ' ');
@@ -160,6 +168,12 @@ std::vector<size_t> Table::widths(size_t available) const {
     --total;
   }
   return widths;
+}
+
+void Table::add(std::vector<Cell> row) {
+  // Widths and cells are looked up by column; a short row would be read beyond its end.
+  TESSEL_INVARIANT(row.size() == columns_.size());
+  rows_.push_back(std::move(row));
 }
 
 std::string Table::render(const Terminal& terminal, size_t indent) const {

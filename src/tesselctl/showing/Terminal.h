@@ -58,7 +58,7 @@ class Table {
 
   explicit Table(std::vector<Column> columns) : columns_(std::move(columns)) {}
   // REQUIRES: as many cells as there are columns.
-  void add(std::vector<Cell> row) { rows_.push_back(std::move(row)); }
+  void add(std::vector<Cell> row);
   bool empty() const { return rows_.empty(); }
   // Titles and rows. Each line ends with a line feed and begins with `indent` spaces.
   std::string render(const Terminal& terminal, size_t indent = 0) const;
