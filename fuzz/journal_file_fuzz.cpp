@@ -87,6 +87,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   JournalEntryStream stream(UniqueFd(::dup(file)), beginning->fileSize, beginning->header, number,
                             {resources(number), table, marks, stop, report});
   readAll(stream, table, size / 8);
-  if (report.problems.size() > FileReport::kMaxProblems + 1) std::abort();
+  if (report.problems.all().size() > Losses::kMaxOfACode + 1) std::abort();
   return 0;
 }

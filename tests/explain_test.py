@@ -343,8 +343,22 @@ class Reading(ExplainTest):
         self.assertEqual(store["dropped"], [{"unit": "vantor.service", "count": 7}])
         self.assertEqual(self.summary()["without_exe"], 1)
         text = self.machine.ctl("explain", "--summary").out
-        for words in ("reaches back to", "by 1 gap", "of vantor.service", "_EXE of trace points"):
+        for words in ("reaches back to", "7 entries_missing: 1 gap in", "(vantor.service)", "process gone before _EXE was read"):
             self.assertIn(words, text)
+
+    def test_the_page_shows_what_was_lost(self):
+        self.machine.write_export([log_event("early", at=-90000), point("event", "a", "b"), point("evnt", "a", "b")])
+        self.assert_clean(self.machine.run())
+        with open(os.path.join(self.machine.store, "<b>.export"), "wb") as file:
+            file.write(b"no equals sign\n\n")
+        path = os.path.join(self.machine.root, "page.html")
+        self.assert_clean(self.machine.ctl("report", "--html", path, "--last-run"))
+        with open(path, encoding="utf-8") as file:
+            tables = PageReader(file.read()).tables
+        malformed = [1, "malformed unknown TESSEL_KIND"]
+        self.assertEqual([row[:2] for row in tables["run_losses"][1:]], [malformed])
+        self.assertEqual([row[:2] for row in tables["losses"][1:]], [[1, "file_damaged line that is no field"], malformed])
+        self.assertEqual(tables["losses"][1][2].strip(), os.path.join(self.machine.store, "<b>.export, byte 0"))
 
     def test_a_damaged_file_is_named_and_the_rest_is_read(self):
         self.machine.write_export([point("event", "com.vantor.A", "B", "C")])

@@ -312,17 +312,19 @@ class Status(CtlTest):
             self.assertTrue(told["store"].pop("range_start"))  # of a moment of its own
         for key in ("store", "malformed", "beyond_pair_limit", "without_exe"):
             self.assertEqual(reading[key], summary[key])
+        self.assertEqual(reading["losses"], json.loads(json.dumps(summary["losses"]).replace("\\u001b", "\\\\x1b")))
+        self.assertEqual(json.loads(self.machine.ctl("compare", "usual", "internal", "--json").out)["losses"], summary["losses"])
         self.assertEqual((reading["store"]["missing"], reading["store"]["dropped"], reading["without_exe"]),
                          (7, [{"unit": "vantor.service", "count": 7}], 1))
         files = {file["path"]: file for file in summary["files"]}
         self.assertEqual(reading["files"], [{"path": refused.replace("\x1b", "\\x1b"), "skipped": files[refused]["skipped"]}])
-        self.assertEqual(reading["problems"], [{"path": damaged, "files": 1, **problem}
-                                               for problem in files[damaged]["problems"]])
+        problem = files[damaged]["problems"][0]
+        self.assertEqual(reading["problems"], [{"path": damaged, "files": 1, **problem}])
         text = re.sub(r"\s+", " ", self.machine.ctl("status").out)
-        for words in ("Store not whole 3 files and 4 entries read The store reaches back to", "7 entries, by 1 gap in",
-                      "7 entries that the journal daemon dropped, of vantor.service", "1 _EXE of trace points",
-                      f"not read: {files[refused]['skipped']}", "\\x1bd.journal",
-                      f"{files[damaged]['problems'][0]['reason']}, 1 time, first at byte 0 of"):
+        for words in ("Store not whole 3 files and 4 entries read The store reaches back to",
+                      "7 entries_missing: 1 gap in the sequence numbers", "7 dropped_by_daemon: ", "(vantor.service)",
+                      "1 no_image_path: process gone before _EXE was read", f"1 file_skipped: {files[refused]['skipped']} (",
+                      "\\x1bd.journal", f"1 file_damaged: {problem['reason']} (", "byte 0)"):
             self.assertIn(words, text)
 
     def test_a_record_without_a_reading_shows_no_store(self):

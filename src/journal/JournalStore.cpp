@@ -78,12 +78,27 @@ static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
 // The sequence of a stream whose entries may count in any.
 constexpr Id128 kNoSequence{};
 
+// Adds what one file yielded to what the store did.
+void addFile(const FileReport& file, StoreReading& reading) {
+  if (!file.skipped) {
+    ++reading.filesRead;
+  } else if (file.outsideRange) {
+    ++reading.filesOutsideRange;
+  } else {
+    reading.losses.add(LossCode::fileSkipped, *file.skipped, {file.path, {}});
+  }
+  for (Loss problem : file.problems.all()) {
+    problem.place.name = file.path;
+    reading.losses.add(std::move(problem));
+  }
+}
+
 }  // namespace
 
 struct JournalStore::State final : EntryStream {
   State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag)
       : range(timeRange), stop(stopFlag), tokenizer(user), merger(stopFlag) {
-    facts.rangeStart = range.start;
+    facts.reading.rangeStart = range.start;
   }
 
   bool next() override;
@@ -97,7 +112,8 @@ struct JournalStore::State final : EntryStream {
   bool outsideRange(const JournalHeader& header) const;
   std::optional<PlatformError> failure(const std::string& place) const;
   void seeTime(uint64_t realtime) {
-    if (!facts.oldestEntry || realtime < *facts.oldestEntry) facts.oldestEntry = realtime;
+    auto& oldest = facts.reading.oldestEntry;
+    if (!oldest || realtime < *oldest) oldest = realtime;
   }
 
   const TimeRange range;
@@ -121,7 +137,7 @@ bool JournalStore::State::next() {
     sequences.see(entry);
     seeTime(entry.realtime);
     if (entry.realtime < range.start || entry.realtime >= range.end) continue;
-    ++facts.entriesRead;
+    ++facts.reading.entriesRead;
     ++facts.files[merger.streamNumber()].entriesRead;
     return true;
   }
@@ -136,7 +152,8 @@ Entry JournalStore::State::entry() {
 
 // The report's list of files is made before the first stream: streams keep references into it.
 void JournalStore::State::openFiles(StoreFiles found) {
-  facts.filesNotLookedAt = found.leftOut;
+  facts.reading.losses.add(LossCode::filesNotLookedAt, "too many files to look at", {},
+                           found.leftOut);
   facts.files.resize(found.files.size());
   for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
     facts.files[i].path = found.files[i].path;
@@ -250,13 +267,21 @@ EntryStream& JournalStore::entries() { return *state_; }
 
 StoreReport JournalStore::report() const {
   StoreReport report = state_->facts;
+  StoreReading& reading = report.reading;
   uint64_t inFiles = 0;
-  for (const FileReport& file : report.files) inFiles += file.entriesRead;
-  TESSEL_INVARIANT(inFiles == report.entriesRead);  // each delivered entry counts for one file
-  report.duplicateEntries = state_->merger.duplicates();
-  report.sequenceGaps = state_->sequences.gaps();
-  report.missingEntries = state_->sequences.missing();
-  report.dropped = state_->tokenizer.dropped();
+  for (const FileReport& file : report.files) {
+    inFiles += file.entriesRead;
+    addFile(file, reading);
+  }
+  TESSEL_INVARIANT(inFiles == reading.entriesRead);  // each delivered entry counts for one file
+  reading.duplicateEntries = state_->merger.duplicates();
+  reading.sequenceGaps = state_->sequences.gaps();
+  reading.losses.add(LossCode::entriesMissing,
+                     std::to_string(reading.sequenceGaps) +
+                         (reading.sequenceGaps == 1 ? " gap" : " gaps") +
+                         " in the sequence numbers",
+                     {}, state_->sequences.missing());
+  state_->tokenizer.addDropped(reading.losses);
   return report;
 }
 

@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <charconv>
-#include <iterator>
 
 namespace tessel {
 
@@ -97,11 +96,17 @@ void LossTokenizer::count(std::span<const FieldToken> tokens) {
   if (loss) units_[unit].count += number;
 }
 
-std::vector<DroppedEntries> LossTokenizer::dropped() const {
-  std::vector<DroppedEntries> dropped;
-  std::copy_if(units_.begin(), units_.end(), std::back_inserter(dropped),
-               [](const DroppedEntries& one) { return one.count != 0; });
-  return dropped;
+void LossTokenizer::addDropped(Losses& losses) const {
+  std::vector<DroppedEntries> units = units_;
+  std::erase_if(units, [](const DroppedEntries& one) { return one.count == 0; });
+  // Up to the list's own limit the order of first sight stays, which is that of the journal.
+  if (units.size() > Losses::kMaxOfACode) {
+    std::stable_sort(
+        units.begin(), units.end(),
+        [](const DroppedEntries& a, const DroppedEntries& b) { return a.count > b.count; });
+  }
+  for (const auto& [unit, count] : units)
+    losses.add(LossCode::droppedByDaemon, "over the journal's rate limit", {unit, {}}, count);
 }
 
 }  // namespace tessel

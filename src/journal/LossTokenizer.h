@@ -14,7 +14,7 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
-#include "journal/StoreReport.h"
+#include "platform/Losses.h"
 
 namespace tessel {
 
@@ -36,10 +36,15 @@ class LossTokenizer final : public FieldTokenizer {
   // The tokens of an entry without our own; valid until the next call. If the entry tells of a
   // loss, counts it. Call it once for each entry.
   std::span<const FieldToken> takeOwn(std::span<const FieldToken> tokens);
-  // What was counted: first what belongs to no unit, then the units in the order they were met.
-  std::vector<DroppedEntries> dropped() const;
+  // Adds what was counted. If the list has no room for all units, those that lost most come first.
+  void addDropped(Losses& losses) const;
 
  private:
+  struct DroppedEntries {
+    std::string unit;  // empty: the daemon named none, or one too many
+    uint64_t count = 0;
+  };
+
   FieldToken unitToken(std::string_view name);
   void count(std::span<const FieldToken> own);
 

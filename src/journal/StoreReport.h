@@ -10,56 +10,26 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/Losses.h"
+
 namespace tessel {
 
-// Something that was wrong with a file, how often, and where it was met first.
-struct FileProblem {
-  std::string reason;
-  uint64_t firstPlace = 0;  // byte offset in the file
-  uint64_t count = 0;
-
-  bool operator==(const FileProblem&) const = default;
-};
-
 struct FileReport {
-  // Distinct reasons that are kept apart for one file; further ones are counted together.
-  static constexpr size_t kMaxProblems = 32;
-
   std::string path;
   uint64_t entriesRead = 0;            // of those in the range
   std::optional<std::string> skipped;  // why the file was not read; absent where it was
   bool outsideRange = false;           // that is why: it has nothing for the range, and all is well
-  std::vector<FileProblem> problems;
+  Losses problems;                     // damage; the places are of this file and have no name
 
-  void addProblem(std::string_view reason, uint64_t place, uint64_t count = 1);
-  bool operator==(const FileReport&) const = default;
-};
-
-// Entries that the journal daemon dropped, by the unit that wrote them.
-struct DroppedEntries {
-  std::string unit;  // empty: the daemon named none, or one too many
-  uint64_t count = 0;
-
-  bool operator==(const DroppedEntries&) const = default;
+  // `offset` is the byte where the damage was met.
+  void addProblem(std::string_view reason, uint64_t offset, uint64_t count = 1) {
+    problems.add(LossCode::fileDamaged, reason, {{}, offset}, count);
+  }
 };
 
 struct StoreReport {
+  StoreReading reading;
   std::vector<FileReport> files;
-  uint64_t entriesRead = 0;       // with start <= realtime < end, each once
-  uint64_t duplicateEntries = 0;  // left out because they stand in another file as well
-  // Microseconds since 1970 of the oldest entry that the store still holds, of those read and by
-  // the headers of those that were not; absent where there is none.
-  std::optional<uint64_t> oldestEntry;
-  uint64_t rangeStart = 0;  // microseconds since 1970
-  // Jumps of the sequence number by more than one, and the numbers left out by them.
-  uint64_t sequenceGaps = 0;
-  uint64_t missingEntries = 0;
-  std::vector<DroppedEntries> dropped;  // of no unit first, then in order of first sight
-  uint64_t filesNotLookedAt = 0;        // beyond the limit on the number of files
-
-  // Whether the store reaches back to the start of the range.
-  bool reachesRangeStart() const { return oldestEntry && *oldestEntry <= rangeStart; }
-  bool operator==(const StoreReport&) const = default;
 };
 
 }  // namespace tessel

@@ -68,8 +68,8 @@ class ExportEntryStreamTest : public ::testing::TestWithParam<size_t> {
   }
   Lines problems() const {
     Lines lines;
-    for (const FileProblem& problem : report.problems) {
-      lines.push_back(problem.reason + " at " + std::to_string(problem.firstPlace) + " x" +
+    for (const Loss& problem : report.problems.all()) {
+      lines.push_back(problem.words + " at " + std::to_string(problem.place.offset.value()) + " x" +
                       std::to_string(problem.count));
     }
     return lines;
@@ -148,9 +148,7 @@ TEST_P(ExportEntryStreamTest, goesOnAfterBadData) {
     append(c.text);
     append(kGood);
     EXPECT_THAT(readAll(), ::testing::Contains("7: T=good")) << c.text;
-    uint64_t counted = 0;
-    for (const FileProblem& problem : report.problems) counted += problem.count;
-    EXPECT_EQ(counted, ++bad) << c.text;
+    EXPECT_EQ(report.problems.sum(LossCode::fileDamaged), ++bad) << c.text;
     EXPECT_THAT(problems(), ::testing::Contains(::testing::StartsWith(c.problem))) << c.text;
   }
 }
@@ -192,9 +190,9 @@ TEST_P(ExportEntryStreamTest, wrongLengthsCostLinearTime) {
   for (int i = 0; i < 20'000; ++i) text += kGood;
   append(text);
   EXPECT_GT(readAll().size(), 5'000u);
-  ASSERT_EQ(report.problems.size(), 1u);
-  EXPECT_EQ(report.problems[0].reason, "value of another length than stated");
-  EXPECT_LT(report.problems[0].count, 50u);
+  ASSERT_EQ(report.problems.all().size(), 1u);
+  EXPECT_EQ(report.problems.all()[0].words, "value of another length than stated");
+  EXPECT_LT(report.problems.all()[0].count, 50u);
 }
 
 TEST_P(ExportEntryStreamTest, unfinishedBadDataCountsOnce) {
@@ -250,7 +248,7 @@ TEST_F(ExportResourcesTest, whatAllStreamsKeepIsBounded) {
     EXPECT_LE(resources_.bytesKept, ExportEntryStream::kMaxBytesKeptByAll);
   }
   EXPECT_EQ(large, 4u);
-  EXPECT_EQ(report_.problems.at(0).count, 16u);
+  EXPECT_EQ(report_.problems.all().at(0).count, 16u);
   streams_.clear();
   EXPECT_EQ(resources_.bytesKept, 0u);
 }
@@ -280,8 +278,8 @@ TEST(ExportPipeTest, aPipeIsReadToItsEnd) {
   ExportEntryStream stream(ends[0], resources, tokenizer, stop, report);
   EXPECT_TRUE(stream.next());
   EXPECT_FALSE(stream.next());
-  ASSERT_EQ(report.problems.size(), 1u);
-  EXPECT_EQ(report.problems[0].reason, "incomplete last entry");
+  ASSERT_EQ(report.problems.all().size(), 1u);
+  EXPECT_EQ(report.problems.all()[0].words, "incomplete last entry");
 }
 
 TEST(EntryCursorTest, readsWhatItWritesAndNothingElse) {

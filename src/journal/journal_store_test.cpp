@@ -95,8 +95,8 @@ TEST(JournalStoreTest, DeliversCopiesInOtherFilesOnce) {
   directory.write("twice.journal", twice.bytes());
   const Reading reading = readStore(directory.path());
   EXPECT_EQ(reading.entries.size(), 32u);
-  EXPECT_EQ(reading.report.entriesRead, 32u);
-  EXPECT_EQ(reading.report.duplicateEntries, 15u);
+  EXPECT_EQ(reading.report.reading.entriesRead, 32u);
+  EXPECT_EQ(reading.report.reading.duplicateEntries, 15u);
 }
 
 // Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
@@ -128,8 +128,8 @@ TEST(JournalStoreTest, DeliversOnceInACircularOrder) {
     for (const PlainEntry& entry : reading.entries)
       numbers[entry.header.sequenceId].push_back(entry.header.sequenceNumber);
     EXPECT_EQ(reading.entries.size(), 4 * kEntries) << seed;
-    EXPECT_EQ(reading.report.duplicateEntries, 4 * (kEntries + 30)) << seed;
-    EXPECT_EQ(reading.report.missingEntries, 0u) << seed;
+    EXPECT_EQ(reading.report.reading.duplicateEntries, 4 * (kEntries + 30)) << seed;
+    EXPECT_EQ(reading.report.reading.losses.sum(LossCode::entriesMissing), 0u) << seed;
     for (const auto& [sequence, all] : numbers)
       EXPECT_TRUE(std::is_sorted(all.begin(), all.end())) << seed;
   }
@@ -147,8 +147,8 @@ TEST(JournalStoreTest, SkipsClosedFilesOutsideTheRange) {
   EXPECT_TRUE(reading.report.files.at(0).outsideRange);
   EXPECT_EQ(reading.report.files.at(1).entriesRead, 3u);
   EXPECT_FALSE(reading.report.files.at(2).skipped);
-  EXPECT_EQ(reading.report.oldestEntry, kBase + 1'000'000);
-  EXPECT_TRUE(reading.report.reachesRangeStart());
+  EXPECT_EQ(reading.report.reading.oldestEntry, kBase + 1'000'000);
+  EXPECT_TRUE(reading.report.reading.reachesRangeStart());
 }
 
 TEST(JournalStoreTest, FiltersEachEntryByASetBackClock) {
@@ -178,11 +178,11 @@ TEST(JournalStoreTest, TellsGapsInTheSequence) {
   directory.write("a.journal", someJournal(10, 1));
   directory.write("b.journal", someJournal(10, 14));
   const Reading reading = readStore(directory.path());
-  EXPECT_EQ(reading.report.sequenceGaps, 1u);
-  EXPECT_EQ(reading.report.missingEntries, 3u);
+  EXPECT_EQ(reading.report.reading.sequenceGaps, 1u);
+  EXPECT_EQ(reading.report.reading.losses.sum(LossCode::entriesMissing), 3u);
   const std::string last = "__REALTIME_TIMESTAMP=1\n__SEQNUM_ID=" + std::string(32, 'a') +
                            "\n__SEQNUM=18446744073709551615\n\n";
-  EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.sequenceGaps, 0u);
+  EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.reading.sequenceGaps, 0u);
 }
 
 TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
@@ -196,11 +196,12 @@ TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
   writer.add(header, {message, "N_DROPPED=5", "OBJECT_SYSTEMD_UNIT=a.service", "PRIORITY=4"});
   writer.add(header, {message, "N_DROPPED=1"});
   const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
-  ASSERT_EQ(reading.report.dropped.size(), 2u);
-  EXPECT_EQ(reading.report.dropped[0].unit, "");
-  EXPECT_EQ(reading.report.dropped[0].count, 1u);
-  EXPECT_EQ(reading.report.dropped[1].unit, "a.service");
-  EXPECT_EQ(reading.report.dropped[1].count, 17u);
+  const auto& dropped = reading.report.reading.losses.all();
+  ASSERT_EQ(dropped.size(), 2u);
+  EXPECT_EQ(dropped[0].place.name, "");
+  EXPECT_EQ(dropped[0].count, 1u);
+  EXPECT_EQ(dropped[1].place.name, "a.service");
+  EXPECT_EQ(dropped[1].count, 17u);
   EXPECT_EQ(reading.entries.at(2).fields, (std::vector<std::string>{"PRIORITY=4"}));
 }
 
@@ -221,11 +222,11 @@ TEST(JournalStoreTest, CountsEachOfManyLosses) {
   writer.add(header, {message, "N_DROPPED=1", "OBJECT_SYSTEMD_UNIT=" + tooLong});
   writer.add(header, {message, "N_DROPPED=some"});
   const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
-  uint64_t sum = 0;
-  for (const DroppedEntries& dropped : reading.report.dropped) sum += dropped.count;
-  EXPECT_EQ(sum, kLosses * (kLosses + 1) / 2 + 1);
-  EXPECT_EQ(reading.report.dropped.size(), LossTokenizer::kMaxUnits + 1);
-  EXPECT_EQ(reading.report.dropped[0].unit, "");
+  const Losses& losses = reading.report.reading.losses;
+  EXPECT_EQ(losses.sum(LossCode::droppedByDaemon), kLosses * (kLosses + 1) / 2 + 1);
+  ASSERT_EQ(losses.all().size(), Losses::kMaxOfACode + 1);
+  EXPECT_EQ(losses.all()[0].place.name, "") << "904 units were too many to tell apart";
+  EXPECT_EQ(losses.all()[1].count, LossTokenizer::kMaxUnits) << "then those that lost most";
 }
 
 TEST(JournalStoreTest, SaysWhyThereIsNoStore) {
@@ -265,10 +266,10 @@ TEST(JournalStoreTest, LeavesUnknownFilesToJournalctl) {
   const Reading reading = readStore(directory.path());
   EXPECT_EQ(reading.entries.size(), 10u);
   ASSERT_FALSE(reading.report.files.at(0).problems.empty());
-  const FileProblem& last = reading.report.files.at(0).problems.back();
-  EXPECT_EQ(last.reason, "entries that journalctl did not read");
+  const Loss& last = reading.report.files.at(0).problems.all().back();
+  EXPECT_EQ(last.words, "entries that journalctl did not read");
   EXPECT_EQ(last.count, 10u);
-  EXPECT_LE(reading.report.files.at(1).problems.back().count, file.size())
+  EXPECT_LE(reading.report.files.at(1).problems.all().back().count, file.size())
       << "no more than the file can hold";
 }
 

@@ -79,7 +79,7 @@ class MarkedEntriesTest : public ::testing::TestWithParam<bool> {
         numbers.insert(entry.header.sequenceNumber);
     }
     const StoreReport report = std::get<0>(opened)->report();
-    problem_ = report.files[0].problems.empty() ? "" : report.files[0].problems[0].reason;
+    problem_ = report.files[0].problems.empty() ? "" : report.files[0].problems.all()[0].words;
     return numbers;
   }
 

@@ -20,6 +20,7 @@
 
 #include "objects/TesselObject.h"
 #include "platform/Error.h"
+#include "platform/Losses.h"
 #include "platform/System.h"
 
 namespace tessel {
@@ -48,6 +49,9 @@ class TesselSupportObjectExtractor {
   virtual void stopProcessing() = 0;
   // Log events that the last processing call read, trace points or not.
   virtual uint64_t processedEventCount() const = 0;
+  // What the last processing call read of the store, and what was lost; absent where there was no
+  // store to read.
+  virtual std::optional<StoreReading> reading() const = 0;
 };
 
 using ExtractorFactory = std::function<std::shared_ptr<TesselSupportObjectExtractor>()>;

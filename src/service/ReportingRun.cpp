@@ -2,6 +2,7 @@
 
 #include "service/ReportingRun.h"
 
+#include "platform/Invariant.h"
 #include "platform/Log.h"
 #include "service/BootVolume.h"
 
@@ -25,39 +26,47 @@ void pollDeferral(Activity& activity, std::atomic<bool>& interruptedByDeferral,
   tesselReporterLog().debug("Concluding processing due to deferral request");
 }
 
-RunReport endedWith(RunEnding ending) {
-  RunReport report;
-  report.ending = ending;
-  return report;
+RunRecord endedWith(RunOutcome outcome, std::string failure = {}) {
+  RunRecord record;
+  record.outcome = outcome;
+  record.failure = std::move(failure);
+  return record;
+}
+
+void addObjects(RunRecord& record, const TesselReporterObjectFilter& filter) {
+  record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
+  record.classified = filter.classifiedCounts();
+  // Each object that was inspected was reported or held back for exactly one reason.
+  TESSEL_INVARIANT(record.objectsBalance());
 }
 
 }  // namespace
 
 void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity) {
   const Date began = surroundings_.clock.now();
-  RunReport ended = attempt(activity);
-  ended.began = began;
-  ended.ended = surroundings_.clock.now();
+  RunRecord record = attempt(activity);
+  record.start = began;
+  record.end = surroundings_.clock.now();
   surroundings_.status.say("idle");
-  runEnded_(ended);
+  runEnded_(record);
 }
 
-RunReport ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
+RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
   surroundings_.status.say("waiting for the tasking configuration");
-  if (!gate_.shouldReport()) return endedWith(RunEnding::notTasked);
+  if (!gate_.shouldReport()) return endedWith(RunOutcome::notTasked);
   if (cookie_.cookieFileExists()) {
     tesselReporterLog().debug("Bailing due to cookie file");
     cookie_.clearCookieFile();
-    return endedWith(RunEnding::bailedOut);
+    return endedWith(RunOutcome::bailedOut);
   }
-  if (!cookie_.createCookieFile()) return endedWith(RunEnding::noMarker);
-  RunReport reported = report(activity);
+  if (!cookie_.createCookieFile())
+    return endedWith(RunOutcome::failed, "the run marker could not be made");
+  RunRecord reported = report(activity);
   cookie_.clearCookieFile();
   return reported;
 }
 
-RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
-  RunReport report;
+RunRecord ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   Clock& clock = surroundings_.clock;
   const uint64_t startTime = clock.continuousTicks();
   const auto extractor = makeExtractor_();
@@ -72,17 +81,19 @@ RunReport ReportingRun::report(const std::shared_ptr<Activity>& activity) {
   surroundings_.status.say("reading the trace store");
   const auto failure = extract(*extractor, startDate, endDate);
   surroundings_.status.say("summarising");
+  RunRecord record =
+      endedWith(failure ? RunOutcome::failed : RunOutcome::completed, failure.value_or(""));
   road_.reportingQueue.sync([&] {
-    report.countEvents = summary_.reportRunSummary(*filter, *extractor, startDate, endDate,
+    record.countEvents = summary_.reportRunSummary(*filter, *extractor, startDate, endDate,
                                                    *interruptedByDeferral, startTime);
   });
-  report.ending = failure ? RunEnding::extractionFailed : RunEnding::completed;
-  report.failure = failure.value_or("");
-  report.unnamed = reporter->unnamedCount();
-  report.filter = filter;
-  report.extractor = extractor;
-  report.interruptedByDeferral = *interruptedByDeferral;
-  return report;
+  // A deferral may come as late as during the summary; it is asked for last.
+  if (!failure && *interruptedByDeferral) record.outcome = RunOutcome::interrupted;
+  record.logEvents = extractor->processedEventCount();
+  record.reading = extractor->reading();
+  record.unnamed = reporter->unnamedCount();
+  addObjects(record, *filter);
+  return record;
 }
 
 std::shared_ptr<ObjectReporter> ReportingRun::makeObjectReporter(

@@ -15,6 +15,7 @@
 #include "filter/TesselReporterObjectFilter.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Queues.h"
+#include "platform/RunRecord.h"
 #include "platform/System.h"
 #include "service/CookieFile.h"
 #include "service/ObjectReporter.h"
@@ -23,25 +24,9 @@
 
 namespace tessel {
 
-// How a run ended.
-enum class RunEnding { notTasked, bailedOut, noMarker, completed, extractionFailed };
-
-// What is known of a run when it has ended. A run that read nothing has neither filter nor
-// extractor.
-struct RunReport {
-  RunEnding ending = RunEnding::notTasked;
-  Date began{};
-  Date ended{};
-  std::string failure;   // why the extraction failed; empty where it did not
-  uint64_t unnamed = 0;  // reported objects that have no event of their own name
-  uint64_t countEvents = 0;
-  std::shared_ptr<const TesselReporterObjectFilter> filter;
-  std::shared_ptr<const TesselSupportObjectExtractor> extractor;
-  bool interruptedByDeferral = false;
-};
-
-// Told how each run ended, on the run's thread, after its last step.
-using RunEndedCallback = std::function<void(const RunReport&)>;
+// Given the record of each run on the run's thread, after its last step. What is not the run's to
+// know, which is what the spool stored and whether the marker is gone, is left to the callback.
+using RunEndedCallback = std::function<void(const RunRecord&)>;
 
 // What a run asks of its surroundings besides the parts it is wired from.
 struct RunSurroundings {
@@ -70,8 +55,8 @@ class ReportingRun {
  private:
   using InterruptedCell = std::shared_ptr<std::atomic<bool>>;
 
-  RunReport attempt(const std::shared_ptr<Activity>& activity);
-  RunReport report(const std::shared_ptr<Activity>& activity);
+  RunRecord attempt(const std::shared_ptr<Activity>& activity);
+  RunRecord report(const std::shared_ptr<Activity>& activity);
   std::shared_ptr<ObjectReporter> makeObjectReporter(
       const std::shared_ptr<TesselReporterObjectFilter>& filter);
   void installCallbacks(TesselSupportObjectExtractor& extractor,

@@ -11,7 +11,7 @@
 #include "linux/AppBundles.h"
 #include "linux/LaunchConfiguration.h"
 #include "linux/LogSinks.h"
-#include "linux/RunRecord.h"
+#include "linux/RunRecordFile.h"
 #include "linux/Scheduler.h"
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
@@ -51,17 +51,6 @@ StateDirectory& stateDirectory(const std::string& path) {
   return keep<StateDirectory>(std::get<StateDirectory>(std::move(opened)));
 }
 
-RunOutcome outcomeOf(const RunReport& report) {
-  if (report.ending == RunEnding::bailedOut) return RunOutcome::bailedOut;
-  if (report.ending != RunEnding::completed) return RunOutcome::failed;
-  return report.interruptedByDeferral ? RunOutcome::interrupted : RunOutcome::completed;
-}
-
-void addObjects(RunRecord& record, const TesselReporterObjectFilter& filter) {
-  record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
-  record.classified = filter.classifiedCounts();
-}
-
 void addRows(RunRecord& record, const SpoolFigures& figures) {
   record.rowsStored = figures.stored;
   record.setAside = figures.setAside;
@@ -71,29 +60,14 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
   }
 }
 
-RunRecord recordOf(const RunReport& report, const SpoolFigures& figures) {
-  RunRecord record;
-  record.start = report.began;
-  record.end = report.ended;
-  record.outcome = outcomeOf(report);
-  record.failure =
-      report.ending == RunEnding::noMarker ? "the run marker could not be made" : report.failure;
-  record.unnamed = report.unnamed;
-  record.countEvents = report.countEvents;
-  if (report.filter) addObjects(record, *report.filter);
-  // The run's extractor is the one that makeRun() hands out.
-  if (report.extractor)
-    record.addReading(static_cast<const JournalExtractor&>(*report.extractor).report());
-  record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
-  addRows(record, figures);
-  return record;
-}
-
-// Leaves the figures of a run for `tesselctl status`, and readies the spool for the next one.
-void keepRecord(const RunReport& report, Spool& spool, const std::string& stateDirectory) {
+// Leaves the record of a run for `tesselctl status`, and readies the spool for the next run. Only
+// the spool knows what it stored, and it knows that only once it is closed.
+void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirectory) {
   spool.endRun();
-  if (report.ending != RunEnding::notTasked) {
-    if (const auto failure = recordOf(report, spool.figures()).write(stateDirectory)) {
+  if (record.outcome != RunOutcome::notTasked) {
+    addRows(record, spool.figures());
+    record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
+    if (const auto failure = writeRunRecord(record, stateDirectory)) {
       tesselReporterLog().debug("Could not keep the record of the run: %@", *failure);
     }
   }
@@ -121,8 +95,8 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
         return extractor;
       },
       road, summary,
-      [&spool, &state, &reportingQueue](const RunReport& report) {
-        reportingQueue.sync([&] { keepRecord(report, spool, state.path()); });
+      [&spool, &state, &reportingQueue](const RunRecord& record) {
+        reportingQueue.sync([&] { keepRecord(record, spool, state.path()); });
       });
 }
 

@@ -53,7 +53,7 @@ class ReportingRunTest : public ::testing::Test {
   std::shared_ptr<testing::FakeExtractor> extractor = std::make_shared<testing::FakeExtractor>();
   std::shared_ptr<testing::FakeActivity> activity = std::make_shared<testing::FakeActivity>();
   testing::FakeServiceStatus status;
-  std::vector<RunReport> reports;
+  std::vector<RunRecord> records;
 
   TaskingGate gate{variant, configurations, queues, clock};
   CookieFile cookie{files};
@@ -67,7 +67,7 @@ class ReportingRunTest : public ::testing::Test {
                    [this] { return nextExtractor(); },
                    road,
                    summary,
-                   [this](const RunReport& report) { reports.push_back(report); }};
+                   [this](const RunRecord& record) { records.push_back(record); }};
 };
 
 TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
@@ -84,7 +84,7 @@ TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
   EXPECT_EQ(extractor->endDate, clock.date);
   EXPECT_FALSE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(activity->statesSet.empty());
-  EXPECT_EQ(reports.at(0).ending, RunEnding::completed);
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::completed);
   EXPECT_THAT(status.said, ElementsAre("waiting for the tasking configuration",
                                        "reading the trace store", "summarising", "idle"));
 }
@@ -106,7 +106,7 @@ TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsAndOneWithoutANameAsOneBefor
   }
   EXPECT_EQ(names[6], "com.vantor.performance.tessel");
   EXPECT_EQ(names[7], "com.vantor.performance.tessel_counts");
-  EXPECT_EQ(reports.at(0).unnamed, 1u);
+  EXPECT_EQ(records.at(0).unnamed, 1u);
   EXPECT_EQ(names.back(), "com.vantor.performance.tessel_reporting_stats");
   EXPECT_EQ(
       sender.events[0].json,
@@ -121,7 +121,7 @@ TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
   EXPECT_TRUE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(extractor->calls.empty());
   EXPECT_TRUE(sender.events.empty());
-  EXPECT_EQ(reports.at(0).ending, RunEnding::notTasked);
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::notTasked);
 }
 
 TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
@@ -134,8 +134,8 @@ TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
   EXPECT_TRUE(sender.events.empty());
   perform();
   EXPECT_EQ(sender.names().back(), "com.vantor.performance.tessel_reporting_stats");
-  EXPECT_EQ(reports.at(0).ending, RunEnding::bailedOut);
-  EXPECT_EQ(reports.at(1).ending, RunEnding::completed);
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::bailedOut);
+  EXPECT_EQ(records.at(1).outcome, RunOutcome::completed);
 }
 
 TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
@@ -143,7 +143,8 @@ TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
   perform();
   EXPECT_EQ(log.lines().back(), "Could not create cookie file");
   EXPECT_TRUE(extractor->calls.empty());
-  EXPECT_EQ(reports.at(0).ending, RunEnding::noMarker);
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::failed);
+  EXPECT_EQ(records.at(0).failure, "the run marker could not be made");
 }
 
 TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
@@ -171,8 +172,8 @@ TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
   EXPECT_EQ(log.count("Failed to process tessel data due to error: /store: no such directory"), 1u);
   EXPECT_NE(sender.events.back().json.find("\"LogObjectsProcessed\":7"), std::string::npos);
   EXPECT_FALSE(files.items.contains(cookieFilePath));
-  EXPECT_EQ(reports.at(0).ending, RunEnding::extractionFailed);
-  EXPECT_EQ(reports.at(0).failure, "/store: no such directory");
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::failed);
+  EXPECT_EQ(records.at(0).failure, "/store: no such directory");
 }
 
 TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
@@ -223,7 +224,7 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
   EXPECT_THAT(sender.names(), ElementsAre("com.vantor.performance.tessel_reporting_stats"));
   EXPECT_NE(sender.events.back().json.find("\"WasInterrupted\":true"), std::string::npos);
   EXPECT_TRUE(activity->statesSet.empty());
-  EXPECT_TRUE(reports.at(0).interruptedByDeferral);
+  EXPECT_EQ(records.at(0).outcome, RunOutcome::interrupted);
   const auto timer = queues.timers.back();
   EXPECT_EQ(timer->interval, std::chrono::seconds{10});
   EXPECT_EQ(timer->leeway, std::chrono::seconds{10});
@@ -232,7 +233,6 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
 
 TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   perform();
-  reports.clear();
   const std::weak_ptr<testing::FakeExtractor> weak = extractor;
   extractor.reset();
   EXPECT_TRUE(weak.expired());
@@ -270,7 +270,7 @@ TEST_F(ReportingRunTest, FivePairsOfEachSectionAreSentAndTheRestOnlyCounted) {
                                     Pair("DurationThresholdFiltered", "C0=1 C1=1 C2=1 C3=1 C4=1 "),
                                     Pair("Reported", "C6=7 C5=6 C4=5 C3=4 C2=3 "),
                                     Pair("ReportedEvents", "C6=7 C5=6 C4=5 C3=4 C2=3 ")));
-  EXPECT_EQ(reports.at(0).countEvents, 20u);
+  EXPECT_EQ(records.at(0).countEvents, 20u);
   EXPECT_EQ(status.steps, 35u + 28u) << "each object and each pair is progress";
   EXPECT_EQ(throttle.throttledCount(), 8u) << "each pair of a section is paced, sent or not";
   EXPECT_EQ(log.count("com.vantor.Calendar/C2:\t4 (Count reported to Statora)"), 1u);
@@ -294,13 +294,18 @@ TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
                         makeAnimationInterval(capped), makeAnimationInterval(reported)};
   extractor->eventCount = 99;
   extractor->duringProcessing = [this] { clock.advance(std::chrono::milliseconds{1250}); };
+  extractor->found.emplace().losses.add(LossCode::malformed, "words", {}, 3);
   const Date began = clock.date;
   perform();
-  const RunReport& report = reports.at(0);
-  EXPECT_EQ(report.began, began);
-  EXPECT_EQ(report.ended, clock.date);
-  EXPECT_EQ(report.filter->allInspectedTesselObjectsAggregation().totalCount(), 8u);
-  EXPECT_EQ(report.extractor, extractor);
+  RunRecord expected;
+  expected.start = began;
+  expected.end = clock.date;
+  expected.logEvents = 99;
+  expected.inspected = 8;
+  expected.classified = {2, 4, 0, 1, 1, 0};
+  expected.countEvents = records.at(0).countEvents;
+  expected.reading = extractor->found;
+  EXPECT_EQ(records.at(0), expected);
   EXPECT_EQ(
       sender.events.back().json,
       R"({"ProcessingDurationInSeconds":1.25,"LogObjectsProcessed":99,"AnimationsReported":1,)"
@@ -350,7 +355,7 @@ TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTrans
   }
   EXPECT_THAT(log.lines(), ElementsAre("Checking in\n", "Unknown state 1\n", "Unknown state 3\n",
                                        "Unknown state -5\n"));
-  EXPECT_TRUE(reports.empty());
+  EXPECT_TRUE(records.empty());
 }
 
 TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
@@ -366,7 +371,7 @@ TEST_F(ReporterActivityTest, ADeferralThatIsNotTakenRunsAllTheSame) {
   activity->deferWanted = true;
   activity->takesStates = false;
   handle();
-  EXPECT_EQ(reports.size(), 1u);
+  EXPECT_EQ(records.size(), 1u);
   EXPECT_EQ(log.count("Deferred tessel_reporter\n"), 0u);
   EXPECT_EQ(runtime.calls, aroundEverything);
 }

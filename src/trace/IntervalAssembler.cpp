@@ -21,6 +21,19 @@ static_assert(inSlot(FieldKind::string1Name, kLabelledStrings) == FieldKind::num
 
 }  // namespace
 
+// The counts are kept as plain numbers and put in words only at the end, because most stores hold
+// millions of entries.
+void addLosses(const AssemblyCounts& counts, Losses& losses) {
+  losses.add(LossCode::noImagePath, "process gone before _EXE was read", {},
+             counts.withoutImagePath);
+  for (size_t reason = 0; reason < kMalformedReasons; ++reason) {
+    losses.add(LossCode::malformed, malformedReasonText(static_cast<MalformedReason>(reason)), {},
+               counts.malformed[reason]);
+  }
+  losses.add(LossCode::openIntervalDropped, "begins that were too many to wait", {},
+             counts.droppedOpenIntervals);
+}
+
 IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
                                      OpenIntervalLimits limits)
     : table_(table), sink_(sink), open_(limits) {}

@@ -16,6 +16,7 @@
 
 #include "journal/EntryStream.h"
 #include "objects/TesselObject.h"
+#include "platform/Losses.h"
 #include "trace/OpenIntervals.h"
 #include "trace/TracePointTable.h"
 
@@ -47,6 +48,10 @@ struct AssemblyCounts {
   uint64_t droppedOpenIntervals = 0;  // open intervals beyond the limits
   uint64_t openIntervals = 0;         // begins that still wait for their end
 };
+
+// Adds those of them that are losses. Begins and ends that found no partner are none: the partner
+// may be of the day before or after.
+void addLosses(const AssemblyCounts& counts, Losses& losses);
 
 class IntervalAssembler {
  public:

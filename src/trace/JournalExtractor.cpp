@@ -5,11 +5,14 @@
 
 #include "journal/JournalStore.h"
 #include "platform/Invariant.h"
+#include "platform/Log.h"
 
 namespace tessel {
 
 namespace {
 
+// Progress is told to the service manager's watchdog. A few thousand entries take milliseconds, so
+// asking more often would only cost time.
 constexpr uint64_t kEntriesPerStep = 4096;
 
 // Dates before 1970 are before every entry.
@@ -24,8 +27,18 @@ void checkBooks(const ExtractionReport& report) {
   const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
                           counts.openIntervals;
   const uint64_t ends = counts.pairedEnds + counts.unmatchedEnds;
+  const uint64_t refused = report.store.reading.losses.sum(LossCode::beyondPairLimit);
   TESSEL_INVARIANT(counts.tracePoints == counts.events + begins + ends);
-  TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + report.beyondPairLimit);
+  TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + refused);
+}
+
+// At the end of the reading and once for each loss: a line for each damaged entry would fill the
+// journal that is being read.
+void logLosses(const Losses& losses) {
+  if (!tesselReporterLog().isEnabled(LogLevel::debug)) return;
+  for (const Loss& loss : losses.all()) {
+    tesselReporterLog().debug("Trace store: lost %llu %@", loss.count, loss);
+  }
 }
 
 }  // namespace
@@ -72,7 +85,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
   JournalStore& store = *std::get<std::unique_ptr<JournalStore>>(opened);
   processEntries(store.entries());
   report_.store = store.report();
-  logReport(report());
+  logLosses(report().store.reading.losses);
   return true;
 }
 
@@ -87,12 +100,23 @@ void JournalExtractor::processEntries(EntryStream& entries) {
   report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);
 }
 
-ExtractionReport JournalExtractor::report() const {
+// The losses of the store and those of its entries are kept apart until somebody asks, because a
+// store may be read again while the assembler counts on.
+ExtractionReport JournalExtractor::report(const StoreReport& store) const {
   ExtractionReport report = report_;
   report.assembly = assembler_.counts();
   report.pairs = pairs_.pairs();
-  report.beyondPairLimit = pairs_.refusals();
+  report.store = store;
+  Losses& losses = report.store.reading.losses;
+  addLosses(report.assembly, losses);
+  losses.add(LossCode::beyondPairLimit, "too many pairs of subsystem and category", {},
+             pairs_.refusals());
   return report;
+}
+
+std::optional<StoreReading> JournalExtractor::reading() const {
+  if (report_.store.files.empty()) return std::nullopt;  // the store could not be opened
+  return report().store.reading;
 }
 
 bool JournalExtractor::admits(StringRef subsystem, StringRef category) {

@@ -13,9 +13,9 @@
 #include <string>
 
 #include "journal/EntryStream.h"
+#include "journal/StoreReport.h"
 #include "objects/TesselSupportObjectExtractor.h"
 #include "platform/System.h"
-#include "trace/ExtractionReport.h"
 #include "trace/IntervalAssembler.h"
 #include "trace/PairLimit.h"
 #include "trace/TracePointTable.h"
@@ -26,6 +26,16 @@ struct ExtractionLimits {
   TracePointTableLimits table;
   OpenIntervalLimits openIntervals;
   PairLimits pairs;
+};
+
+// What the processing calls found, beside what they delivered.
+struct ExtractionReport {
+  uint64_t entriesRead = 0;  // trace points or not
+  AssemblyCounts assembly;
+  uint64_t delivered = 0;  // objects handed to a callback
+  uint64_t pairs = 0;      // distinct (subsystem, category) among them
+  bool stopped = false;    // by stopProcessing() or a callback that answered false
+  StoreReport store;       // its losses include those of entries that were read
 };
 
 class JournalExtractor final : public TesselSupportObjectExtractor, private TraceObjectSink {
@@ -45,6 +55,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
                                  Date endDate, std::optional<PlatformError>& errorOut) override;
   void stopProcessing() override;
   uint64_t processedEventCount() const override { return report_.entriesRead; }
+  std::optional<StoreReading> reading() const override;
 
   // Delivers what `entries` holds until it ends or a stop takes effect. May be called again, with
   // the same stream after it grew or with another: intervals that are open stay open in between.
@@ -56,8 +67,10 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   // Where the entry stands that the object of the running callback came from; an interval comes
   // from its end. REQUIRES: a callback is running.
   const EntryHeader& currentEntry() const { return *current_; }
-  // About what was processed so far; the store's part is there after the processing call.
-  ExtractionReport report() const;
+  // About what was processed so far. The store's part is there after the processing call; who
+  // reads a store of his own hands in what that one reports.
+  ExtractionReport report() const { return report(report_.store); }
+  ExtractionReport report(const StoreReport& store) const;
 
  private:
   bool admits(StringRef subsystem, StringRef category) override;

@@ -76,8 +76,8 @@ TEST_F(ExportFileTest, halfAnEntryOfAnotherWriterCostsThatEntry) {
   std::ofstream(path(), std::ios::app) << "__REALTIME_TIMESTAMP=1\nTESSEL_NA";
   ASSERT_TRUE(append("second"));
   EXPECT_EQ(names(), (std::vector<std::string>{"first", "second"}));
-  ASSERT_EQ(report.problems.size(), 1u);
-  EXPECT_EQ(report.problems[0].count, 1u);
+  ASSERT_EQ(report.problems.all().size(), 1u);
+  EXPECT_EQ(report.problems.all()[0].count, 1u);
 }
 
 TEST_F(ExportFileTest, anErrorNamesThePathAndTheReason) {

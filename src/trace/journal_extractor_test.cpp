@@ -21,7 +21,6 @@ using ::testing::Contains;
 using ::testing::ElementsAre;
 using testing::FakeEntry;
 using testing::FakeEntryStream;
-using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using testing::tracePoint;
 using Lines = std::vector<std::string>;
@@ -76,7 +75,7 @@ TEST_F(JournalExtractorTest, eachKindGoesToItsOwnCallbackAndEveryEntryCounts) {
   EXPECT_EQ(extractor().processedEventCount(), 8u);
   const ExtractionReport report = extractor().report();
   EXPECT_EQ(report.delivered, 3u);
-  EXPECT_EQ(report.malformed(MalformedReason::unknownKind), 1u);
+  EXPECT_EQ(report.store.reading.losses.sum(LossCode::malformed), 1u);
   EXPECT_EQ(report.assembly.unmatchedEnds, 1u);
   EXPECT_EQ(report.assembly.withoutImagePath, 6u);
 }
@@ -105,7 +104,6 @@ TEST_F(JournalExtractorTest, theCurrentEntryIsThatOfTheObject) {
 
 TEST_F(JournalExtractorTest, pairsBeyondTheLimitAreNotDelivered) {
   limits.pairs.pairs = 2;
-  testing::RecordingLog log;
   process({tracePoint("event|CATEGORY=a"), tracePoint("event|CATEGORY=b"),
            tracePoint("event|CATEGORY=c"), tracePoint("begin|CATEGORY=c"),
            tracePoint("end|CATEGORY=c"), tracePoint("event|CATEGORY=a"),
@@ -113,9 +111,7 @@ TEST_F(JournalExtractorTest, pairsBeyondTheLimitAreNotDelivered) {
   EXPECT_THAT(delivered, ElementsAre("Event a", "Event b", "Event a"));
   const ExtractionReport report = extractor().report();
   EXPECT_EQ(report.pairs, 2u);
-  EXPECT_EQ(report.beyondPairLimit, 3u);
-  logReport(report);
-  EXPECT_THAT(log.lines(), Contains(HasSubstr("3 objects were not delivered")));
+  EXPECT_EQ(report.store.reading.losses.sum(LossCode::beyondPairLimit), 3u);
 }
 
 TEST_F(JournalExtractorTest, theTextOfPairsIsLimitedToo) {
@@ -176,13 +172,17 @@ TEST_F(JournalExtractorTest, aStoreOnDiskIsReadWithinTheRange) {
                                     {{"TESSEL_KIND", "event"},
                                      {"TESSEL_SUBSYSTEM", "s"},
                                      {"TESSEL_CATEGORY", std::to_string(time)}}));
+    ASSERT_FALSE(appendToExportFile(store.path(), origin, {{"TESSEL_KIND", "begin"}}));
   }
+  testing::RecordingLog log;
   std::optional<PlatformError> error;
   const Date start(std::chrono::microseconds(100));
   EXPECT_TRUE(extractor().processLogArchiveWithPath(store.path(), start,
                                                     start + std::chrono::microseconds(100), error));
   EXPECT_THAT(delivered, ElementsAre("Event 100", "Event 199"));
-  EXPECT_EQ(extractor().processedEventCount(), 2u);
+  EXPECT_EQ(extractor().processedEventCount(), 4u);
+  EXPECT_EQ(extractor().reading()->losses.sum(LossCode::malformed), 2u);
+  EXPECT_THAT(log.lines(), Contains("Trace store: lost 2 malformed: missing TESSEL_SUBSYSTEM"));
 }
 
 }  // namespace

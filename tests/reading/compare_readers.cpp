@@ -29,8 +29,8 @@ using Clock = std::chrono::steady_clock;
 void printReport(const StoreReport& report) {
   for (const FileReport& file : report.files) {
     if (file.skipped) std::cout << "skipped " << file.path << ": " << *file.skipped << "\n";
-    for (const FileProblem& problem : file.problems)
-      std::cout << "problem " << file.path << ": " << problem.reason << " x" << problem.count
+    for (const Loss& problem : file.problems.all())
+      std::cout << "problem " << file.path << ": " << problem.words << " x" << problem.count
                 << "\n";
   }
 }
@@ -99,8 +99,8 @@ int compare(const std::string& path, bool withOthers) {
   size_t spared = 0;
   const auto led = withOthers ? readLedByKind(path, ours, spared) : ours;
   std::cout << "entries " << ours.size() << " repeated " << repeated(ours) << " duplicates "
-            << report.duplicateEntries << " files " << report.files.size() << " spared " << spared
-            << "\n";
+            << report.reading.duplicateEntries << " files " << report.files.size() << " spared "
+            << spared << "\n";
   printReport(report);
   if (!withOthers) return 0;
   std::vector<std::string> files;

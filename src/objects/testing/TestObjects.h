@@ -41,11 +41,13 @@ struct FakeExtractor final : TesselSupportObjectExtractor {
                                  Date endDate, std::optional<PlatformError>& errorOut) override;
   void stopProcessing() override;
   uint64_t processedEventCount() const override { return eventCount; }
+  std::optional<StoreReading> reading() const override { return found; }
 
   std::vector<std::shared_ptr<const TesselObject>> objects;
   std::optional<PlatformError> failure;
   std::function<void()> beforeProcessing, duringProcessing;
   uint64_t eventCount = 0;
+  std::optional<StoreReading> found;
 
   std::vector<std::string> calls;  // in order: setters, option, "process", "stop"
   std::optional<std::string> processedPath;

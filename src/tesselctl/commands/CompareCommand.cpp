@@ -12,6 +12,7 @@
 #include "platform/Text.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
+#include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/SummaryOutput.h"
 #include "tesselctl/showing/Terminal.h"
 
@@ -121,8 +122,14 @@ struct Comparison {
   VerdictCounts sides[2] = {};
   Changes changes;
   std::optional<PlatformError> error;
-  StoreReport store;
+  StoreReport store;  // of the last reading
+  Losses losses;      // of each reading
 };
+
+void addReading(const DryRun& run, Comparison& comparison) {
+  comparison.store = run.report().store;
+  comparison.losses.add(comparison.store.reading.losses);
+}
 
 // Both judge each object of one period.
 void compareJudges(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
@@ -143,7 +150,7 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
   ProgressBar bar(true);
   comparison.error = run.read(settings[0].period,
                               [&](double part, uint64_t entries) { bar.update(part, entries); });
-  comparison.store = run.report().store;
+  addReading(run, comparison);
 }
 
 // Trace points of one kind in each of two periods.
@@ -186,7 +193,7 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
     comparison.error = run.read(settings[side].period, [&](double part, uint64_t entries) {
       bar.update((part + static_cast<double>(side)) / 2, entries);
     });
-    comparison.store = run.report().store;
+    addReading(run, comparison);
   }
   for (const auto& [path, figures] : paths) {
     const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];
@@ -217,6 +224,7 @@ std::string comparisonJson(const Comparison& comparison) {
     json.array("changes", comparison.changes.listed(),
                [&](const auto& counted) { writeChange(json, counted.first, counted.second); });
     json.member("changes_not_listed", comparison.changes.notListed());
+    addLosses(json, comparison.losses);
   });
 }
 
@@ -250,6 +258,7 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
                             terminal.width, 2) +
                     "\n";
   if (!table.empty()) out += "\n" + table.render(terminal, 2);
+  if (!comparison.losses.empty()) out += "\n" + lossText(comparison.losses, terminal);
   return out;
 }
 

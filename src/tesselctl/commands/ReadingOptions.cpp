@@ -68,6 +68,7 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const LaunchConf
 
 int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string>& store,
                       int status) {
+  const uint64_t notLookedAt = report.reading.losses.sum(LossCode::filesNotLookedAt);
   uint64_t refused = 0;
   const std::string* first = nullptr;
   for (const FileReport& file : report.files) {
@@ -81,9 +82,9 @@ int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string
                           errorWords(EACCES),
                       store);
   }
-  if (report.filesNotLookedAt != 0) {
-    fail(kBad, counted(report.filesNotLookedAt, "file", "files") +
-                   " of the store were one too many and not read");
+  if (notLookedAt != 0) {
+    fail(kBad,
+         counted(notLookedAt, "file", "files") + " of the store were one too many and not read");
     return kBad;
   }
   return status;

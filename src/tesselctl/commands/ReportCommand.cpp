@@ -6,7 +6,7 @@
 #include <array>
 #include <memory>
 
-#include "linux/RunRecord.h"
+#include "linux/RunRecordFile.h"
 #include "linux/SystemFacts.h"
 #include "os/DurableFile.h"
 #include "tesselctl/commands/ReadingOptions.h"
@@ -67,7 +67,7 @@ int runReport(const ReportOptions& options) {
   if (!reading) return kUsage;
   if (options.lastRun) {
     if (options.reading.period.given()) return fail(kUsage, "--last-run has a period of its own");
-    facts.run = RunRecord::read(launch->stateDirectory);
+    facts.run = readRunRecord(launch->stateDirectory);
     if (!facts.run) return fail(kBad, "no record of a run in " + launch->stateDirectory);
     reading->period = {facts.run->start - std::chrono::hours{24}, facts.run->start};
   }

@@ -37,7 +37,7 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
     json.member("objects_balance", run.objectsBalance());
     json.member("rows_balance", run.rowsBalance());
   }
-  if (run.reading) json.rawMember("reading", jsonLine(digestJson(*run.reading)));
+  if (run.reading) json.object("reading", [&] { addReading(json, *run.reading); });
 }
 
 void writeSpool(JsonWriter& json, const ReporterStatus& status) {
@@ -112,6 +112,7 @@ class Screen {
  private:
   static constexpr size_t kLabelWidth = 12;
   static constexpr size_t kAnswerWidth = 13;
+  static constexpr size_t kLossesOfACode = 5;  // a store of many bad files must not fill the screen
 
   void line(std::string_view label, std::string_view answer, Colour colour,
             const std::string& words) {
@@ -186,15 +187,17 @@ class Screen {
          balances ? words : "balance: " + words);
   }
 
-  void store(const ReadingDigest& reading, uint64_t entries) {
+  // A caution at most: what the store had lost before the run is no failure of the reporter.
+  void store(const StoreReading& reading, uint64_t entries) {
     std::string words = counted(reading.filesRead, "file", "files") + " and " +
                         counted(entries, "entry", "entries") + " read";
     if (reading.filesOutsideRange != 0)
       words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
-    const std::vector<std::string> losses = wordsForLosses(reading);
-    line("Store", losses.empty() ? "whole" : "not whole",
-         losses.empty() ? Colour::good : Colour::caution, words);
-    for (const std::string& loss : losses) more(loss);
+    const std::string part = partOfPeriod(reading);
+    const bool whole = part.empty() && reading.losses.empty();
+    line("Store", whole ? "whole" : "not whole", whole ? Colour::good : Colour::caution, words);
+    if (!part.empty()) more(part);
+    for (const std::string& loss : lossLines(reading.losses, kLossesOfACode)) more(loss);
   }
 
   void marker() {

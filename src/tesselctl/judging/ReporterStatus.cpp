@@ -6,6 +6,7 @@
 #include <memory>
 
 #include "journal/JournalStore.h"
+#include "linux/RunRecordFile.h"
 #include "linux/Scheduler.h"
 #include "linux/StateDirectory.h"
 #include "linux/SystemFacts.h"
@@ -39,7 +40,7 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   }
   auto& trace = *std::get<std::unique_ptr<JournalStore>>(opened);
   trace.entries().next();  // files whose headers do not tell show their first entry
-  if (const auto oldest = trace.report().oldestEntry) {
+  if (const auto oldest = trace.report().reading.oldestEntry) {
     facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};
   }
   return facts;
@@ -55,7 +56,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch) {
   status.taskingWords = taskingWords(status.tasking, launch);
   status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
   status.marker = lookForMarker();
-  status.run = RunRecord::read(launch.stateDirectory);
+  status.run = readRunRecord(launch.stateDirectory);
   status.lastBegin = state.lastRun();
   SpoolReader spool(launch.stateDirectory);
   status.spoolState = spool.open();

@@ -10,7 +10,7 @@
 #include <string>
 
 #include "linux/LaunchConfiguration.h"
-#include "linux/RunRecord.h"
+#include "platform/RunRecord.h"
 #include "tesselctl/judging/Tasking.h"
 #include "tesselctl/reading/SpoolReader.h"
 
@@ -43,10 +43,7 @@ struct ReporterStatus {
   JournalFacts journal;
 
   // A run that got as far as sending anything.
-  bool hasBooks() const {
-    return run &&
-           (run->outcome == RunOutcome::completed || run->outcome == RunOutcome::interrupted);
-  }
+  bool hasBooks() const { return run && run->hasBooks(); }
   bool good() const {
     if (run && run->outcome == RunOutcome::failed) return false;
     if (hasBooks() && (!run->objectsBalance() || !run->rowsBalance())) return false;

@@ -165,10 +165,4 @@ std::optional<PlatformError> DryRun::follow(Date start,
   return {};
 }
 
-ExtractionReport DryRun::report() const {
-  ExtractionReport report = extractor_.report();
-  report.store = storeReport_;
-  return report;
-}
-
 }  // namespace tessel::ctl

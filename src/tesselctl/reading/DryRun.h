@@ -38,7 +38,7 @@ class DryRun {
   std::optional<PlatformError> follow(Date start, const std::function<void()>& afterEachLook);
 
   // What was found so far; the store's part is that of the last reading.
-  ExtractionReport report() const;
+  ExtractionReport report() const { return extractor_.report(storeReport_); }
 
  private:
   std::optional<PlatformError> readOnce(TimeRange range,

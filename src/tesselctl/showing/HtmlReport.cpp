@@ -13,6 +13,7 @@
 #include <cmath>
 
 #include "tesselctl/showing/Html.h"
+#include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/ReportStyle.h"
 #include "tesselctl/showing/Terminal.h"
 
@@ -294,22 +295,31 @@ Html readingSection(const ExtractionReport& report, const ReportFacts& facts) {
   };
   row("log events", report.entriesRead);
   row("trace points among them", report.assembly.tracePoints);
-  for (const auto& [reason, count] : malformedCounts(report)) row("malformed: " + reason, count);
   const std::pair<std::string_view, uint64_t> rest[] = {
       {"ends whose begin was not read", report.assembly.unmatchedEnds},
       {"begins replaced by a second one", report.assembly.replacedBegins},
       {"begins that wait for their end", report.assembly.openIntervals},
-      {"begins that were one too many to wait", report.assembly.droppedOpenIntervals},
-      {"objects of one subsystem and category too many", report.beyondPairLimit},
-      {"entries that stand in two files", report.store.duplicateEntries},
-      {"entries that the journal itself lost", report.store.missingEntries},
+      {"entries that stand in two files", report.store.reading.duplicateEntries},
   };
   for (const auto& [what, count] : rest) {
     if (count != 0) row(what, count);
   }
-  for (const FileReport& file : report.store.files) {
-    for (const FileProblem& problem : file.problems)
-      row(file.path + ": " + problem.reason, problem.count);
+  return html << "</table></div>\n</section>\n";
+}
+
+// Left out where nothing was lost. `id` tells the losses of this reading from those of the run.
+Html lossSection(const StoreReading& reading, std::string_view title, std::string_view id) {
+  Html html;
+  const std::string part = partOfPeriod(reading);
+  if (part.empty() && reading.losses.empty()) return html;
+  html << "<section>\n<h2>" << title << "</h2>\n";
+  if (!part.empty()) html << "<p>" << part << ".</p>\n";
+  html << "<div class=\"scroll\"><table id=\"" << id
+       << "\"><tr><th class=\"n\">Lost</th><th>Why</th><th>Where</th></tr>\n";
+  for (const Loss& loss : reading.losses.all()) {
+    html << "<tr><td class=\"n\">" << loss.count << "</td><td class=\"name\"><code>"
+         << lossName(loss.code) << "</code> " << loss.words << "</td><td class=\"name\">"
+         << loss.where() << "</td></tr>\n";
   }
   return html << "</table></div>\n</section>\n";
 }
@@ -319,8 +329,7 @@ Html runSection(const ReportFacts& facts) {
   if (!facts.run) return html;
   const RunRecord& run = *facts.run;
   html << "<section>\n<h2>The run's own books</h2>\n<p class=\"soft\">" << dateText(run.start)
-       << ", " << std::string_view(runOutcomeName(run.outcome))
-       << "</p>\n<div class=\"scroll\"><table id=\"run\">";
+       << ", " << runOutcomeName(run.outcome) << "</p>\n<div class=\"scroll\"><table id=\"run\">";
   const auto row = [&html](std::string_view what, uint64_t count) {
     html << "<tr><td>" << what << "</td><td class=\"n\">" << count << "</td></tr>\n";
   };
@@ -328,14 +337,16 @@ Html runSection(const ReportFacts& facts) {
   for (const auto verdict : kVerdictOrder) row(title(verdict), run.classified[verdict]);
   row("rows stored in the spool", run.rowsStored);
   html << "</table></div>\n";
-  if (run.outcome == RunOutcome::completed || run.outcome == RunOutcome::interrupted) {
+  if (run.hasBooks()) {
     const bool balanced = run.objectsBalance() && run.rowsBalance();
     html << "<p>The books "
          << (balanced ? Html() << "<span class=\"good\">balance</span>"
                       : Html() << "<span class=\"bad\">do not balance</span>")
          << ".</p>\n";
   }
-  return html << "</section>\n";
+  html << "</section>\n";
+  if (run.reading) html << lossSection(*run.reading, "What the run lost", "run_losses");
+  return html;
 }
 
 }  // namespace
@@ -358,8 +369,9 @@ std::string htmlReport(const Tally& tally, const ExtractionReport& report,
        << tiles(tally, report) << verdictSection(tally);
   if (tally.traceObjects() != 0)
     html << timeSection(tally) << pairSection(tally) << missSection(tally) << kindSection(tally);
-  html << runSection(facts) << readingSection(report, facts) << "</main>\n<footer>Made on "
-       << dateText(facts.made)
+  html << runSection(facts) << readingSection(report, facts)
+       << lossSection(report.store.reading, "What was lost", "losses")
+       << "</main>\n<footer>Made on " << dateText(facts.made)
        << " by tesselctl, on this machine, for this machine: nothing of it was sent.</footer>\n"
           "</body>\n</html>\n";
   return html.text();

@@ -7,9 +7,9 @@
 #include <optional>
 #include <string>
 
-#include "linux/RunRecord.h"
+#include "platform/RunRecord.h"
 #include "tesselctl/judging/Tally.h"
-#include "trace/ExtractionReport.h"
+#include "trace/JournalExtractor.h"
 
 namespace tessel::ctl {
 

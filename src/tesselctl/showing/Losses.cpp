@@ -1,8 +1,9 @@
-// The words for losses.
+// Laying out losses.
+//
+// The members of `malformed`, `store`, `files` and `problems` are older than the list of losses.
+// Programs read them, so they are made of the list and stay as they were.
 
 #include "tesselctl/showing/Losses.h"
-
-#include <algorithm>
 
 #include "platform/Text.h"
 #include "tesselctl/reading/TimeArguments.h"
@@ -11,103 +12,112 @@ namespace tessel::ctl {
 
 namespace {
 
-constexpr size_t kShownOfAKind = 5;
-
-std::string entries(uint64_t count) { return count == 1 ? "entry" : "entries"; }
-
-std::string droppedOf(uint64_t count, const std::string& units) {
-  return entries(count) + " that the journal daemon dropped, of " + units;
-}
-
-std::vector<Loss> summedLosses(const StoreReport& store, uint64_t withoutImagePath) {
-  return thoseThatOccurred(
-      {{store.filesNotLookedAt, "files that were too many to look at"},
-       {store.missingEntries, entries(store.missingEntries) + ", by " +
-                                  counted(store.sequenceGaps, "gap", "gaps") +
-                                  " in the sequence numbers"},
-       {withoutImagePath, "_EXE of trace points, whose process was gone too soon"}});
-}
-
-std::vector<Loss> droppedEntries(const StoreReport& store) {
-  std::vector<Loss> losses;
-  for (const auto& [unit, count] : store.dropped)
-    losses.push_back({count, droppedOf(count, unit.empty() ? "no unit" : unit)});
-  return losses;
-}
-
-std::vector<std::string> inWords(const std::vector<Loss>& losses) {
-  std::vector<std::string> lines;
-  lines.reserve(losses.size());
-  for (const Loss& loss : losses) lines.push_back(grouped(loss.count) + " " + loss.what);
-  return lines;
-}
-
-// Appends the first of `kind`; says how many more there are, `notListed` among them.
-void addShown(std::vector<std::string>& lines, const std::vector<std::string>& kind,
-              uint64_t notListed = 0) {
-  const size_t shown = std::min(kind.size(), kShownOfAKind);
-  lines.insert(lines.end(), kind.begin(), kind.begin() + static_cast<std::ptrdiff_t>(shown));
-  const uint64_t further = kind.size() - shown + notListed;
-  if (further != 0) lines.push_back("... and " + grouped(further) + " more of this kind");
-}
-
-std::string damageWords(const StoreProblem& problem) {
-  return problem.reason + ", " + counted(problem.count, "time", "times") +
-         (problem.files == 1 ? "" : " in " + grouped(problem.files) + " files") +
-         ", first at byte " + grouped(problem.firstPlace) + " of " + problem.path;
+// The losses of one code that are told apart. The "other" one has neither a file nor a unit to
+// name, so it is told as a count of its own.
+std::vector<Loss> toldApart(const Losses& losses, LossCode code) {
+  std::vector<Loss> found;
+  for (const Loss& loss : losses.all()) {
+    if (loss.code == code && !loss.isOther()) found.push_back(loss);
+  }
+  return found;
 }
 
 }  // namespace
 
-std::vector<Loss> thoseThatOccurred(std::vector<Loss> losses) {
-  std::erase_if(losses, [](const Loss& loss) { return loss.count == 0; });
-  return losses;
-}
-
-std::vector<Loss> entryLosses(const MalformedCounts& malformed, uint64_t droppedOpenIntervals,
-                              uint64_t beyondPairLimit) {
-  std::vector<Loss> losses;
-  for (const auto& [reason, count] : malformed) losses.push_back({count, "malformed: " + reason});
-  losses.push_back({droppedOpenIntervals, "a begin that was one too many to wait"});
-  losses.push_back({beyondPairLimit, "of a subsystem and category that were one pair too many"});
-  return thoseThatOccurred(std::move(losses));
-}
-
-std::vector<Loss> storeLosses(const StoreReport& store, uint64_t withoutImagePath) {
-  std::vector<Loss> losses = summedLosses(store, withoutImagePath);
-  const std::vector<Loss> dropped = droppedEntries(store);
-  losses.insert(losses.end(), dropped.begin(), dropped.end());
-  return losses;
-}
-
-std::string partOfPeriod(const StoreReport& store) {
-  if (!store.oldestEntry || store.reachesRangeStart()) return {};
-  const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*store.oldestEntry)}};
+std::string partOfPeriod(const StoreReading& reading) {
+  if (!reading.oldestEntry || reading.reachesRangeStart()) return {};
+  const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*reading.oldestEntry)}};
   return "The store reaches back to " + dateText(oldest) + " only";
 }
 
-std::vector<std::string> wordsForLosses(const ReadingDigest& reading) {
-  std::vector<std::string> lines = inWords(summedLosses(reading.store, reading.withoutImagePath));
-  if (std::string part = partOfPeriod(reading.store); !part.empty())
-    lines.insert(lines.begin(), std::move(part));
-  addShown(lines, inWords(droppedEntries(reading.store)));
-  if (const uint64_t further = reading.droppedNotListed; further != 0)
-    lines.push_back(grouped(further) + " " + droppedOf(further, "further units"));
-  std::vector<std::string> files;
-  for (const FileReport& file : reading.store.files)
-    files.push_back(whyNotRead(file) + ": " + file.path);
-  addShown(lines, files, reading.filesNotListed);
-  std::vector<std::string> damage;
-  for (const StoreProblem& problem : reading.problems) damage.push_back(damageWords(problem));
-  addShown(lines, damage);
-  for (const Loss& loss :
-       entryLosses(reading.malformed, reading.droppedOpenIntervals, reading.beyondPairLimit)) {
-    lines.push_back("no trace object came of " + counted(loss.count, "entry", "entries") + ": " +
-                    loss.what);
+void addLosses(JsonWriter& json, const Losses& losses) {
+  json.array("losses", losses.all(), [&](const Loss& loss) {
+    json.object([&] {
+      json.member("code", lossName(loss.code)).member("count", loss.count);
+      json.member("words", loss.words);
+      if (!loss.place.name.empty()) json.member("place", loss.place.name);
+      json.member("offset", loss.place.offset);
+      if (loss.places > 1) json.member("places", loss.places);
+    });
+  });
+}
+
+void addMalformed(JsonWriter& json, const Losses& losses) {
+  json.object("malformed", [&] {
+    for (const Loss& loss : toldApart(losses, LossCode::malformed))
+      json.member(loss.words, loss.count);
+  });
+}
+
+void addStore(JsonWriter& json, const StoreReading& reading) {
+  const Losses& losses = reading.losses;
+  json.member("beyond_pair_limit", losses.sum(LossCode::beyondPairLimit));
+  json.member("without_exe", losses.sum(LossCode::noImagePath));
+  json.object("store", [&] {
+    json.member("oldest", reading.oldestEntry);
+    json.member("reaches_start", reading.reachesRangeStart());
+    json.member("range_start", reading.rangeStart).member("entries_read", reading.entriesRead);
+    json.member("duplicates", reading.duplicateEntries);
+    json.member("sequence_gaps", reading.sequenceGaps);
+    json.member("missing", losses.sum(LossCode::entriesMissing));
+    json.member("files_not_looked_at", losses.sum(LossCode::filesNotLookedAt));
+    json.array("dropped", toldApart(losses, LossCode::droppedByDaemon), [&](const Loss& loss) {
+      json.object([&] { json.member("unit", loss.place.name).member("count", loss.count); });
+    });
+  });
+}
+
+void addReading(JsonWriter& json, const StoreReading& reading) {
+  const Losses& losses = reading.losses;
+  addMalformed(json, losses);
+  json.object("intervals",
+              [&] { json.member("dropped", losses.sum(LossCode::openIntervalDropped)); });
+  addStore(json, reading);
+  json.member("dropped_not_listed", losses.notListed(LossCode::droppedByDaemon));
+  json.member("files_read", reading.filesRead);
+  json.member("files_outside_range", reading.filesOutsideRange);
+  json.array("files", toldApart(losses, LossCode::fileSkipped), [&](const Loss& loss) {
+    json.object([&] { json.member("path", loss.place.name).member("skipped", loss.words); });
+  });
+  json.member("files_not_listed", losses.notListed(LossCode::fileSkipped));
+  // Damage that had no room is listed here with the reason "other", and not as a count beside.
+  std::vector<Loss> problems = losses.all();
+  std::erase_if(problems, [](const Loss& loss) { return loss.code != LossCode::fileDamaged; });
+  json.array("problems", problems, [&](const Loss& loss) {
+    json.object([&] {
+      json.member("reason", loss.words).member("count", loss.count);
+      json.member("files", loss.places).member("path", loss.place.name);
+      json.member("first_place", loss.place.offset);
+    });
+  });
+  addLosses(json, losses);
+}
+
+std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode) {
+  std::vector<std::string> lines;
+  const std::vector<Loss>& all = losses.all();
+  for (size_t at = 0; at < all.size();) {
+    const LossCode code = all[at].code;
+    // What is not shown is what the shown ones leave of the sum, so the lines add up to it.
+    uint64_t further = losses.sum(code);
+    for (size_t shown = 0; at < all.size() && all[at].code == code; ++at, ++shown) {
+      if (shown >= mostOfACode) continue;
+      lines.push_back(grouped(all[at].count) + " " + all[at].description());
+      further -= all[at].count;
+    }
+    if (further != 0) lines.push_back(grouped(further) + " more " + std::string(lossName(code)));
   }
   return lines;
 }
 
-std::string whyNotRead(const FileReport& file) { return "not read: " + file.skipped.value_or(""); }
+// Lines and not a table: the end of a path, the byte in the file and a unit's name all matter, and
+// the columns of a table would cut them.
+std::string lossText(const Losses& losses, const Terminal& terminal) {
+  if (losses.empty()) return {};
+  std::string out = terminal.paint(Colour::strong, "What was lost") + "\n";
+  for (const std::string& line : lossLines(losses, Losses::kMaxOfACode))
+    out += "  " + wrapped(terminalText(line), terminal.width - 2, 4) + "\n";
+  return out;
+}
 
 }  // namespace tessel::ctl

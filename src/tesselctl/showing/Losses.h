@@ -1,36 +1,35 @@
-// Losses: what was lost of a period between the programs that recorded and the reader, in words.
+// What was read of a trace store and what was lost: as JSON and as lines.
 //
-// The words are not yet fit for a terminal: they hold names of units and files as they were met.
-// Stateless; any thread.
+// The words come with the losses. Here they are laid out and made fit to be shown. Stateless; any
+// thread.
 
 #pragma once
 
-#include <cstdint>
 #include <string>
 #include <vector>
 
-#include "linux/ReadingDigest.h"
-#include "trace/ExtractionReport.h"
+#include "platform/Json.h"
+#include "platform/Losses.h"
+#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
-struct Loss {
-  uint64_t count = 0;
-  std::string what;  // reads on after the count
-};
-
-// Without those that are zero.
-std::vector<Loss> thoseThatOccurred(std::vector<Loss> losses);
-// Of what no trace object came although the entries were read.
-std::vector<Loss> entryLosses(const MalformedCounts& malformed, uint64_t droppedOpenIntervals,
-                              uint64_t beyondPairLimit);
-// What the store itself has lost or never had.
-std::vector<Loss> storeLosses(const StoreReport& store, uint64_t withoutImagePath);
 // That the store holds only a part of the period, without a full stop; empty where it holds all.
-std::string partOfPeriod(const StoreReport& store);
-// REQUIRES: it was not.
-std::string whyNotRead(const FileReport& file);
-// All of these, of a run: a line for each, or for the first of each kind.
-std::vector<std::string> wordsForLosses(const ReadingDigest& reading);
+std::string partOfPeriod(const StoreReading& reading);
+
+// `losses`: they are written alike wherever they are shown.
+void addLosses(JsonWriter& json, const Losses& losses);
+// `malformed`: reason to count.
+void addMalformed(JsonWriter& json, const Losses& losses);
+// `beyond_pair_limit`, `without_exe` and `store`.
+void addStore(JsonWriter& json, const StoreReading& reading);
+// The members of a reading as `status --json` has it.
+void addReading(JsonWriter& json, const StoreReading& reading);
+
+// A line for each loss, but of each code no more than `mostOfACode` and one for the others. The
+// lines are not yet fit for a terminal.
+std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode);
+// All losses under a heading, fit for `terminal`; empty where there is none.
+std::string lossText(const Losses& losses, const Terminal& terminal);
 
 }  // namespace tessel::ctl

@@ -3,9 +3,7 @@
 #include "tesselctl/showing/SummaryOutput.h"
 
 #include <algorithm>
-#include <nlohmann/json.hpp>
 
-#include "linux/ReadingDigest.h"
 #include "platform/Text.h"
 #include "tesselctl/showing/Losses.h"
 
@@ -13,10 +11,13 @@ namespace tessel::ctl {
 
 namespace {
 
+// Both tables fit on one screen of 50 lines; whoever wants all of them asks for JSON.
 constexpr size_t kShownPairs = 20;
 constexpr size_t kShownMisses = 20;
 constexpr size_t kQuotedWidth = 40;  // columns of a value in a sentence
 
+// In tenths of a percent, rounded. A share of nothing is left blank, because a column of "0.0 %"
+// hides the figures that matter.
 std::string share(uint64_t part, uint64_t whole) {
   if (whole == 0 || part == 0) return "";
   const uint64_t permille = (part * 1000 + whole / 2) / whole;
@@ -39,6 +40,7 @@ std::string whitelistWords(const FilterDecision& decision) {
 
 std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string& scope) {
   std::string words = shortened(terminalText(scope), kQuotedWidth);
+  // A row without a cap lets nothing through; its ratio means nothing then.
   if (entry.cap() == 0) return words + " is never reported";
   words += ": one in " + grouped(entry.downsampleRatio()) + ", at most " + grouped(entry.cap()) +
            "; this is number " + grouped(entry.eventsSeen()) + ", " +
@@ -46,6 +48,8 @@ std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string&
   return words;
 }
 
+// An absent subsystem is written as an empty text here, where `explain` leaves the key out: each
+// element of an array then has the same keys, which tools for tables want.
 void writePairs(JsonWriter& json, const Tally& tally) {
   json.array("pairs", tally.pairs(), [&](const Tally::Pair& pair) {
     json.object([&] {
@@ -70,11 +74,12 @@ void writeFiles(JsonWriter& json, const StoreReport& store) {
   json.array("files", store.files, [&](const FileReport& file) {
     json.object([&] {
       json.member("path", file.path).member("entries_read", file.entriesRead);
+      // A file of other days is skipped, too. Its reason says so, and it is no loss.
       json.member("skipped", file.skipped);
-      json.array("problems", file.problems, [&](const FileProblem& problem) {
+      json.array("problems", file.problems.all(), [&](const Loss& problem) {
         json.object([&] {
-          json.member("reason", problem.reason).member("count", problem.count);
-          json.member("first_place", problem.firstPlace);
+          json.member("reason", problem.words).member("count", problem.count);
+          json.member("first_place", problem.place.offset);
         });
       });
     });
@@ -107,6 +112,7 @@ std::string verdictTable(const Tally& tally, const Terminal& terminal) {
                {"MEANING", Table::Align::left, true}});
   for (const auto verdict : kVerdictOrder) {
     const uint64_t count = tally.verdicts()[verdict];
+    // No store yields such an object today, so its row would only raise questions.
     if (count == 0 && verdict == TesselReporterClassificationClassNotSupported) continue;
     table.add(
         {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
@@ -196,49 +202,23 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
                    terminalText(miss.name)});
   }
   std::string out = table.render(terminal, 2) + more(kShownMisses, misses.size(), "values");
+  // The tally is bounded, so a writer of random values cannot fill the memory; JSON lacks them,
+  // too.
   if (tally.missesNotListed() != 0) {
     out += "  " + counted(tally.missesNotListed(), "object", "objects") + " had further values\n";
   }
   return out;
 }
 
-void addLosses(Table& table, const std::vector<Loss>& losses) {
-  for (const Loss& loss : losses) table.add({grouped(loss.count), terminalText(loss.what)});
-}
-
-std::string lossLines(const ExtractionReport& report, const Terminal& terminal) {
-  const AssemblyCounts& counts = report.assembly;
+// Begins and ends without a partner are no losses: the partner may be of the day before or after.
+std::string unpairedTable(const AssemblyCounts& counts, const Terminal& terminal) {
   Table table({{"ENTRIES", Table::Align::right}, {"WHY NO TRACE OBJECT CAME OF THEM"}});
-  addLosses(table, entryLosses(malformedCounts(report), counts.droppedOpenIntervals,
-                               report.beyondPairLimit));
-  addLosses(table, thoseThatOccurred({
-                       {counts.unmatchedEnds, "an end whose begin was not read"},
-                       {counts.replacedBegins, "a begin that was replaced by a second one"},
-                       {counts.openIntervals, "a begin that waits for its end"},
-                   }));
-  return table.empty() ? "" : "\n" + table.render(terminal, 2);
-}
-
-// What the store itself has lost or never had; empty where nothing is missing.
-std::string storeLines(const ExtractionReport& report, const Terminal& terminal) {
-  const std::string part = partOfPeriod(report.store);
-  Table table(
-      {{"NUMBER", Table::Align::right}, {"WHAT THE STORE LACKS", Table::Align::left, true}});
-  addLosses(table, storeLosses(report.store, report.assembly.withoutImagePath));
-  return (part.empty() ? "" : "\n" + part + ".\n") +
-         (table.empty() ? "" : "\n" + table.render(terminal, 2));
-}
-
-std::string fileLines(const StoreReport& store, const Terminal& terminal) {
-  Table table({{"PROBLEM", Table::Align::left, true},
-               {"TIMES", Table::Align::right},
-               {"FILE", Table::Align::left, true}});
-  for (const FileReport& file : store.files) {
-    if (file.skipped && !file.outsideRange)
-      table.add({terminalText(whyNotRead(file)), "", terminalText(file.path)});
-    for (const FileProblem& problem : file.problems) {
-      table.add({terminalText(problem.reason), grouped(problem.count), terminalText(file.path)});
-    }
+  const std::pair<uint64_t, const char*> rows[] = {
+      {counts.unmatchedEnds, "an end whose begin was not read"},
+      {counts.replacedBegins, "a begin that was replaced by a second one"},
+      {counts.openIntervals, "a begin that waits for its end"}};
+  for (const auto& [count, why] : rows) {
+    if (count != 0) table.add({grouped(count), why});
   }
   return table.empty() ? "" : "\n" + table.render(terminal, 2);
 }
@@ -289,21 +269,19 @@ std::string ruleWords(const FilterDecision& decision, const std::string& scope) 
 }
 
 std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
+  const StoreReading& reading = report.store.reading;
   return objectLine([&](JsonWriter& json) {
     json.member("log_events", report.entriesRead).member("trace_objects", tally.traceObjects());
     json.object("verdicts", [&] { addVerdicts(json, tally.verdicts()); });
     writeKinds(json, tally);
     writePairs(json, tally);
-    json.object("malformed", [&] {
-      for (const auto& [reason, count] : malformedCounts(report)) json.member(reason, count);
-    });
+    addMalformed(json, reading.losses);
     writeMisses(json, tally);
     writeIntervals(json, report.assembly);
-    json.member("beyond_pair_limit", report.beyondPairLimit);
-    json.member("without_exe", report.assembly.withoutImagePath);
-    json.rawMember("store", jsonLine(storeJson(report.store)));
+    addStore(json, reading);
     writeFiles(json, report.store);
     json.member("start", tally.period().start).member("end", tally.period().end);
+    addLosses(json, reading.losses);
   });
 }
 
@@ -319,8 +297,11 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
     out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +
            missTable(tally, terminal);
   }
-  return out + lossLines(report, terminal) + storeLines(report, terminal) +
-         fileLines(report.store, terminal);
+  out += unpairedTable(report.assembly, terminal);
+  const StoreReading& reading = report.store.reading;
+  if (const std::string part = partOfPeriod(reading); !part.empty()) out += "\n" + part + ".\n";
+  if (!reading.losses.empty()) out += "\n" + lossText(reading.losses, terminal);
+  return out;
 }
 
 }  // namespace tessel::ctl

@@ -11,7 +11,7 @@
 #include "platform/Json.h"
 #include "tesselctl/judging/Tally.h"
 #include "tesselctl/showing/Terminal.h"
-#include "trace/ExtractionReport.h"
+#include "trace/JournalExtractor.h"
 
 namespace tessel::ctl {
 

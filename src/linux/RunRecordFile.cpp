@@ -1,0 +1,166 @@
+// The run record as JSON.
+//
+// A program may read the file while a run replaces it, and the power may fail meanwhile. So the
+// file is replaced as a whole, and a reader finds either the old record or the new one.
+
+#include "linux/RunRecordFile.h"
+
+#include <algorithm>
+#include <fstream>
+#include <iterator>
+#include <nlohmann/json.hpp>
+
+#include "os/DurableFile.h"
+#include "platform/Invariant.h"
+#include "platform/Json.h"
+#include "platform/Text.h"
+
+namespace tessel {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+// Sixteen times what we write at most, so that a record of a later service can be read, and a file
+// that somebody put there cannot fill the memory.
+constexpr size_t kMaxRecordBytes = size_t{1} << 20;
+constexpr size_t kMaxFailureBytes = 1024;
+// Three codes tell up to 17 places apart and escaping doubles a text at most: 51 losses of two such
+// texts, with their keys, are 60 KiB.
+constexpr size_t kMaxTextBytes = 256;
+
+std::string recordPath(const std::string& stateDirectory) {
+  return stateDirectory + "/last_run.json";
+}
+
+Date dateAt(const Json& json, const char* key) {
+  return Date{std::chrono::microseconds{json.at(key).get<int64_t>()}};
+}
+
+uint64_t countAt(const Json& json, const char* key) { return json.at(key).get<uint64_t>(); }
+
+// Names that this version does not know make a record that cannot be understood.
+template <typename Value>
+Value required(std::optional<Value> value) {
+  if (!value) throw Json::other_error::create(501, "unknown name", nullptr);
+  return *value;
+}
+
+std::optional<RunOutcome> outcomeNamed(const std::string& name) {
+  const auto* const found = std::find(kRunOutcomeNames.begin(), kRunOutcomeNames.end(), name);
+  if (found == kRunOutcomeNames.end()) return std::nullopt;
+  return static_cast<RunOutcome>(found - kRunOutcomeNames.begin());
+}
+
+Loss lossFrom(const Json& json) {
+  Loss loss{required(lossNamed(json.at("code").get<std::string>())),
+            countAt(json, "count"),
+            json.at("words").get<std::string>(),
+            {json.at("place").get<std::string>(), {}},
+            countAt(json, "places")};
+  if (json.contains("offset")) loss.place.offset = countAt(json, "offset");
+  return loss;
+}
+
+// Texts are cut and made plain only here, at the edge: the list in memory keeps them as they were.
+// Two paths that were cut to the same text become one loss when the record is read, with the sum of
+// both counts.
+void addLoss(JsonWriter& json, const Loss& loss) {
+  json.member("code", lossName(loss.code)).member("count", loss.count);
+  json.member("words", shortPlainText(loss.words, kMaxTextBytes));
+  json.member("place", shortPlainText(loss.place.name, kMaxTextBytes));
+  json.member("offset", loss.place.offset).member("places", loss.places);
+}
+
+void addReading(JsonWriter& json, const StoreReading& reading) {
+  json.member("entries_read", reading.entriesRead);
+  json.member("duplicates", reading.duplicateEntries);
+  json.member("oldest", reading.oldestEntry).member("range_start", reading.rangeStart);
+  json.member("sequence_gaps", reading.sequenceGaps);
+  json.member("files_read", reading.filesRead);
+  json.member("files_outside_range", reading.filesOutsideRange);
+  json.array("losses", reading.losses.all(),
+             [&](const Loss& loss) { json.object([&] { addLoss(json, loss); }); });
+}
+
+StoreReading readingFrom(const Json& json) {
+  StoreReading reading;
+  reading.entriesRead = countAt(json, "entries_read");
+  reading.duplicateEntries = countAt(json, "duplicates");
+  reading.rangeStart = countAt(json, "range_start");
+  reading.sequenceGaps = countAt(json, "sequence_gaps");
+  reading.filesRead = countAt(json, "files_read");
+  reading.filesOutsideRange = countAt(json, "files_outside_range");
+  if (json.contains("oldest")) reading.oldestEntry = countAt(json, "oldest");
+  // The list bounds itself, so a record that names more losses than we write cannot fill it.
+  for (const Json& loss : json.at("losses")) reading.losses.add(lossFrom(loss));
+  return reading;
+}
+
+// An older service kept sums by kind under the same key, and no list of losses.
+bool hasReading(const Json& json) {
+  return json.contains("reading") && !json.at("reading").contains("malformed");
+}
+
+// Throws where a member is missing or of the wrong kind.
+RunRecord recordFrom(const Json& json) {
+  RunRecord record;
+  record.start = dateAt(json, "start");
+  record.end = dateAt(json, "end");
+  record.outcome = required(outcomeNamed(json.at("outcome").get<std::string>()));
+  record.failure = json.at("failure").get<std::string>();
+  record.logEvents = countAt(json, "log_events");
+  record.inspected = countAt(json, "inspected");
+  record.classified =
+      json.at("classified").get<std::array<uint64_t, RunRecord::kClassifications>>();
+  record.unnamed = countAt(json, "unnamed");
+  record.countEvents = countAt(json, "count_events");
+  if (hasReading(json)) record.reading = readingFrom(json.at("reading"));
+  record.rowsStored = countAt(json, "rows_stored");
+  for (const auto& [reason, count] : json.at("rows_failed").items())
+    record.rowsFailed.emplace_back(reason, count.get<uint64_t>());
+  record.setAside = json.at("set_aside").get<std::vector<std::string>>();
+  record.marker = json.at("marker").get<std::string>();
+  return record;
+}
+
+}  // namespace
+
+std::optional<std::string> writeRunRecord(const RunRecord& record,
+                                          const std::string& stateDirectory) {
+  // A run that was not tasked read nothing and must not replace the record of one that did.
+  TESSEL_INVARIANT(record.outcome != RunOutcome::notTasked);
+  std::string text;
+  JsonWriter json(text, {.indent = 1});
+  json.object([&] {
+    json.member("start", record.start).member("end", record.end);
+    json.member("outcome", runOutcomeName(record.outcome));
+    json.member("failure", shortPlainText(record.failure, kMaxFailureBytes));
+    json.member("log_events", record.logEvents).member("inspected", record.inspected);
+    json.array("classified", record.classified, [&](uint64_t count) { json.value(count); });
+    json.member("unnamed", record.unnamed).member("count_events", record.countEvents);
+    if (record.reading) json.object("reading", [&] { addReading(json, *record.reading); });
+    json.member("rows_stored", record.rowsStored);
+    json.object("rows_failed", [&] {
+      for (const auto& [reason, count] : record.rowsFailed) json.member(reason, count);
+    });
+    json.array("set_aside", record.setAside, [&](const std::string& name) { json.value(name); });
+    json.member("marker", record.marker);
+  });
+  return replaceFileDurably(recordPath(stateDirectory), text + "\n");
+}
+
+std::optional<RunRecord> readRunRecord(const std::string& stateDirectory) {
+  std::ifstream file(recordPath(stateDirectory), std::ios::binary);
+  std::string text(kMaxRecordBytes, '\0');
+  file.read(text.data(), static_cast<std::streamsize>(text.size()));
+  text.resize(static_cast<size_t>(file.gcount()));
+  try {
+    return recordFrom(Json::parse(text));
+  } catch (const nlohmann::json::exception&) {
+    // Half a record would show books that do not balance, so a damaged one is taken for none.
+    return {};
+  }
+}
+
+}  // namespace tessel

@@ -1,0 +1,98 @@
+// The names of losses, and the list of them.
+//
+// The list is searched from one end to the other, because it is short: a usual day has fewer than
+// ten losses, and nine codes of 17 are the most that there can be.
+
+#include "platform/Losses.h"
+
+#include <algorithm>
+#include <iterator>
+
+#include "platform/Invariant.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr std::string_view kOther = "other";
+
+// These names stand in the records of runs and in what programs read, so none is ever changed.
+constexpr std::array<std::string_view, kLossCodes> kNames = {
+    "file_skipped",    "files_not_looked_at",   "file_damaged",
+    "entries_missing", "dropped_by_daemon",     "no_image_path",
+    "malformed",       "open_interval_dropped", "beyond_pair_limit"};
+
+// A failing disk damages many files in the same way. What is damaged then says more than each file
+// that has it, so damage is summed over the files. A file that was not read is a loss of its own,
+// and so is what a unit lost.
+bool sumsPlaces(LossCode code) { return code == LossCode::fileDamaged; }
+
+bool isSame(const Loss& a, const Loss& b) {
+  return a.code == b.code && a.words == b.words &&
+         (sumsPlaces(a.code) || a.place.name == b.place.name);
+}
+
+}  // namespace
+
+std::string_view lossName(LossCode code) { return kNames[static_cast<size_t>(code)]; }
+
+std::optional<LossCode> lossNamed(std::string_view name) {
+  const auto* const found = std::find(kNames.begin(), kNames.end(), name);
+  if (found == kNames.end()) return std::nullopt;
+  return static_cast<LossCode>(found - kNames.begin());
+}
+
+// The offset is that of the first place: whoever looks into a damaged file begins there.
+std::string Loss::where() const {
+  std::string where = place.name;
+  if (place.offset) where += (where.empty() ? "byte " : ", byte ") + std::to_string(*place.offset);
+  if (places > 1) where += ", and " + std::to_string(places - 1) + " more";
+  return where;
+}
+
+std::string Loss::description() const {
+  const std::string at = where();
+  return std::string(lossName(code)) + ": " + words + (at.empty() ? "" : " (" + at + ")");
+}
+
+bool Loss::isOther() const { return words == kOther; }
+
+void Losses::add(Loss loss) {
+  if (loss.count == 0) return;
+  const LossCode code = loss.code;
+  uint64_t& sum = sums_[static_cast<size_t>(code)];
+  sum += loss.count;
+  const auto [first, last] = std::ranges::equal_range(losses_, code, {}, &Loss::code);
+  // The "other" loss is the last of its code, so what has no room yet goes in before it.
+  const auto other = first != last && std::prev(last)->isOther() ? std::prev(last) : last;
+  auto known = std::find_if(first, last, [&](const Loss& one) { return isSame(one, loss); });
+  // A store of many bad files must not fill the list, but it must not hide a loss either.
+  if (known == last && static_cast<size_t>(other - first) >= kMaxOfACode) loss.words = kOther;
+  if (loss.isOther()) known = other;
+  if (known != last) {
+    known->count += loss.count;
+    if (known->place.name != loss.place.name) known->places += loss.places;
+  } else {
+    losses_.insert(loss.isOther() ? last : other, std::move(loss));
+  }
+  // Merging and the lack of room change what is told apart, never how much was lost.
+  uint64_t listed = 0;
+  for (const Loss& one : losses_) listed += one.code == code ? one.count : 0;
+  TESSEL_INVARIANT(listed == sum);
+}
+
+void Losses::add(LossCode code, std::string_view words, const LossPlace& place, uint64_t count) {
+  add({code, count, std::string(words), place});
+}
+
+void Losses::add(const Losses& others) {
+  for (const Loss& loss : others.losses_) add(loss);
+}
+
+uint64_t Losses::notListed(LossCode code) const {
+  uint64_t count = 0;
+  for (const Loss& loss : losses_) count += loss.code == code && loss.isOther() ? loss.count : 0;
+  return count;
+}
+
+}  // namespace tessel
