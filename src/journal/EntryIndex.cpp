@@ -25,6 +25,7 @@ EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count, size_t
   if (!enterArray(first) && count_ != 0) damagedAt(first);
 }
 
+// Kept out of next(), which is called for every entry and must stay small enough to be inlined.
 uint64_t EntryChain::firstOfNextPiece() {
   bool more = true;
   while (more && pieceNext_ == pieceSize_) more = loadPiece();
@@ -256,6 +257,7 @@ bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_v
   return true;
 }
 
+// The first entry stands in the value itself: most values occur once and then need no array.
 bool MarkedEntries::IndexReader::addList(const uint8_t* data, uint64_t entries) {
   if (lists_.size() == kMaxLists) return false;
   const auto first = load<uint64_t>(data + kDataFirstEntryAt);

@@ -15,12 +15,6 @@ std::string hexadecimal(uint64_t value) {
   return {buffer, end};
 }
 
-bool parseHexadecimal(std::string_view text, uint64_t& out) {
-  const char* end = text.data() + text.size();
-  const auto [at, error] = std::from_chars(text.data(), end, out, 16);
-  return error == std::errc() && at == end;
-}
-
 bool readPart(EntryHeader& header, char part, std::string_view value) {
   switch (part) {
     case 's':
@@ -30,26 +24,25 @@ bool readPart(EntryHeader& header, char part, std::string_view value) {
       return id.has_value();
     }
     case 'i':
-      return parseHexadecimal(value, header.sequenceNumber);
+      return parseNumber(value, 16, header.sequenceNumber);
     case 'm':
-      return parseHexadecimal(value, header.monotonic);
+      return parseNumber(value, 16, header.monotonic);
     case 't':
-      return parseHexadecimal(value, header.realtime);
+      return parseNumber(value, 16, header.realtime);
     case 'x':
-      return parseHexadecimal(value, header.contentHash);
+      return parseNumber(value, 16, header.contentHash);
     default:
       return false;
   }
 }
 
-int digitOf(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
 }  // namespace
+
+bool parseNumber(std::string_view text, int base, uint64_t& out) {
+  const char* end = text.data() + text.size();
+  const auto [at, error] = std::from_chars(text.data(), end, out, base);
+  return error == std::errc() && at == end;
+}
 
 std::string textOf(const Id128& id) {
   constexpr std::string_view kDigits = "0123456789abcdef";
@@ -66,8 +59,8 @@ std::optional<Id128> parseId128(std::string_view text) {
   size_t digits = 0;
   for (const char c : text) {
     if (c == '-' && text.size() == 36) continue;  // the kernel writes boot ids with dashes
-    const int digit = digitOf(c);
-    if (digit < 0 || digits == 2 * id.size()) return std::nullopt;
+    uint64_t digit = 0;
+    if (digits == 2 * id.size() || !parseNumber({&c, 1}, 16, digit)) return std::nullopt;
     id[digits / 2] = static_cast<uint8_t>(id[digits / 2] * 16 + digit);
     ++digits;
   }

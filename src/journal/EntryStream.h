@@ -114,5 +114,7 @@ std::optional<EntryHeader> parseCursor(std::string_view cursor);
 // Reads 32 hexadecimal digits, with or without the dashes of a UUID; nothing for other texts.
 std::optional<Id128> parseId128(std::string_view text);
 std::string textOf(const Id128& id);
+// Sets `out` if the whole of `text` is a number without sign in `base`; otherwise returns false.
+bool parseNumber(std::string_view text, int base, uint64_t& out);
 
 }  // namespace tessel

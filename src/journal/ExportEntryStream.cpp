@@ -12,10 +12,10 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <charconv>
 #include <utility>
 
 #include "journal/EntryStream.h"
+#include "journal/JournalFormat.h"
 #include "os/UniqueFd.h"
 #include "platform/Invariant.h"
 
@@ -32,18 +32,6 @@ bool isFieldName(std::string_view name) {
   };
   return !name.empty() && name.size() <= kMaxFieldNameLength &&
          std::all_of(name.begin(), name.end(), valid);
-}
-
-bool parseUnsigned(std::string_view text, uint64_t& out) {
-  const char* end = text.data() + text.size();
-  const auto [at, error] = std::from_chars(text.data(), end, out);
-  return error == std::errc() && at == end;
-}
-
-uint64_t littleEndian(std::string_view bytes) {
-  uint64_t value = 0;
-  for (size_t i = 8; i-- > 0;) value = (value << 8) | static_cast<uint8_t>(bytes[i]);
-  return value;
 }
 
 }  // namespace
@@ -163,7 +151,8 @@ ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view n
   head += '=';
   const uint64_t lengthPlace = window_.place();
   if (!window_.fill(8)) return Outcome::ended;
-  const uint64_t length = littleEndian(window_.bytes());
+  const uint64_t length =
+      journal_format::load<uint64_t>(reinterpret_cast<const uint8_t*>(window_.bytes().data()));
   // Checked before the length is passed over: resynchronising then starts right here.
   if (length > kMaxValueLength) return bad("value longer than any");
   window_.consume(8);
@@ -226,12 +215,12 @@ ExportEntryStream::Outcome ExportEntryStream::takeAddress(std::string_view name,
     // A second time means that the empty line between two entries was lost. Reading on would make
     // one entry of both.
     if (hasRealtime_) return bad("two entries without an empty line between");
-    if (!parseUnsigned(value, header_.realtime)) return bad("invalid __REALTIME_TIMESTAMP");
+    if (!parseNumber(value, 10, header_.realtime)) return bad("invalid __REALTIME_TIMESTAMP");
     hasRealtime_ = true;
   } else if (name == "__MONOTONIC_TIMESTAMP") {
-    if (!parseUnsigned(value, header_.monotonic)) return bad("invalid __MONOTONIC_TIMESTAMP");
+    if (!parseNumber(value, 10, header_.monotonic)) return bad("invalid __MONOTONIC_TIMESTAMP");
   } else if (name == "__SEQNUM") {
-    if (!parseUnsigned(value, header_.sequenceNumber)) return bad("invalid __SEQNUM");
+    if (!parseNumber(value, 10, header_.sequenceNumber)) return bad("invalid __SEQNUM");
   } else if (const auto id = parseId128(value)) {
     if (name == "__SEQNUM_ID") header_.sequenceId = *id;
     if (name == "_BOOT_ID") header_.bootId = *id;

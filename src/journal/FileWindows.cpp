@@ -35,6 +35,7 @@ WindowedFile::~WindowedFile() { budget_.leave(); }
 const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
   if (const uint8_t* bytes = inWindow(offset, size)) return bytes;
   if (offset > size_ || size > size_ - offset) return nullptr;
+  // More than the share only for an object that is larger; this bounds the memory of a run.
   const size_t capacity = std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share());
   const uint64_t end = offset + size;
   uint64_t start = std::min(from, offset);
@@ -45,13 +46,13 @@ const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
   // A large window begins at a page, because the kernel copies whole pages faster. In a small one
   // that would waste up to a page; objects begin at multiples of eight.
   start -= start % (capacity >= 8 * kPage ? kPage : 8);
-  moveWindow(start, static_cast<size_t>(end - start));
+  moveWindow(start, std::max(static_cast<size_t>(end - start), capacity));
   return inWindow(offset, size);
 }
 
-void WindowedFile::moveWindow(uint64_t start, size_t least) {
-  const size_t wanted =
-      std::max(least, std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share()));
+// A window of another size is allocated anew: its bytes are read again anyway, from a cache of the
+// kernel, and keeping the old ones would need both at once.
+void WindowedFile::moveWindow(uint64_t start, size_t wanted) {
   if (wanted != windowCapacity_) {
     window_.reset();  // before the new one is taken, so that there are never two
     window_ = std::make_unique_for_overwrite<uint8_t[]>(wanted);
@@ -61,9 +62,7 @@ void WindowedFile::moveWindow(uint64_t start, size_t least) {
   windowLength_ = 0;
   const size_t length = static_cast<size_t>(std::min<uint64_t>(wanted, size_ - start));
   windowLength_ = read(start, {window_.get(), length});
-  // Larger than the share only for one object that is larger. This bounds the memory of a run.
-  TESSEL_INVARIANT(windowLength_ <= windowCapacity_ &&
-                   windowCapacity_ <= std::max(least, budget_.share()));
+  TESSEL_INVARIANT(windowLength_ <= windowCapacity_);
 }
 
 std::span<const uint8_t> WindowedFile::restOfWindow(uint64_t offset) const {

@@ -89,7 +89,7 @@ class WindowedFile {
   size_t read(uint64_t offset, std::span<uint8_t> target);
 
  private:
-  void moveWindow(uint64_t start, size_t least);
+  void moveWindow(uint64_t start, size_t wanted);
 
   UniqueFd fd_;
   uint64_t size_;

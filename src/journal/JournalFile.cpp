@@ -102,6 +102,7 @@ std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
   return JournalBeginning{std::get<JournalHeader>(parsed), fileSize};
 }
 
+// The size of an item and of the data header are computed once: both are asked for every entry.
 JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header,
                          WindowBudget& budget)
     : header_(header),

@@ -254,6 +254,7 @@ JournalStore::~JournalStore() = default;
 std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
     const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
     const StopFlag& stop) {
+  // All files are opened before the first is read: the daemon may rotate while we read.
   auto found = openStoreFiles(path, kMaxFiles, stop);
   if (auto* error = std::get_if<PlatformError>(&found)) return std::move(*error);
   const std::string place = path.value_or("the machine's journal");
@@ -263,6 +264,7 @@ std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
   return std::unique_ptr<JournalStore>(new JournalStore(std::move(state)));
 }
 
+// The state itself is the stream: it sees every entry that the merge delivers, in or out of range.
 EntryStream& JournalStore::entries() { return *state_; }
 
 StoreReport JournalStore::report() const {

@@ -92,7 +92,7 @@ void Finder::visit(const std::string& path, const dirent& entry, int depth) {
     if (const auto kind = kindOf(name)) addFile(path, *kind);
     return;
   }
-  if (depth >= kDeepestDirectory) return;
+  if (depth >= kDeepestDirectory) return;  // unreported: no tool of the journal nests so deep
   const int error = list(path, depth + 1);
   // A directory that vanished was rotated away. Any other error may hide journals and is reported.
   if (error != 0 && error != ENOENT) fail(path, StoreFileKind::journal, error);
@@ -139,6 +139,7 @@ StoreFiles Finder::take() {
 // Every file of the store stays open. The usual soft limit of 1,024 protects programs that use
 // select(); we do not, so we raise it.
 void allowOpenFiles(size_t count) {
+  // Failing is no error: the files that cannot be opened are then reported one by one.
   rlimit limit{};
   if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= count) return;
   limit.rlim_cur = std::min<rlim_t>(count, limit.rlim_max);
