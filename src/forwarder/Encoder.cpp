@@ -45,6 +45,7 @@ std::optional<std::string> instanceId() {
   constexpr sd_id128_t kApplication{{0x6b, 0x1d, 0x0a, 0x5c, 0x9e, 0x3f, 0x4f, 0x0c, 0x8b, 0x61,
                                      0xd2, 0x77, 0x3a, 0x90, 0xe4, 0x15}};
   sd_id128_t id{};
+  // A container without a machine id has no instance id either.
   if (sd_id128_get_machine_app_specific(kApplication, &id) < 0) return {};
   char text[SD_ID128_UUID_STRING_MAX];
   return sd_id128_to_uuid_string(id, text);

@@ -146,6 +146,8 @@ OtlpEncoder::OtlpEncoder(const ResourceFacts& facts) {
 
 std::optional<std::string> OtlpEncoder::record(const SpooledEvent& event,
                                                std::string_view spoolId) const {
+  // The spool has microseconds. The event has no other time, so both of the record's times are this
+  // one.
   const std::string time = std::to_string(event.time) + "000";
   std::string out;
   JsonWriter json(out);
@@ -182,6 +184,8 @@ std::string OtlpEncoder::body(std::span<const OutgoingRecord> records) const {
   return all;
 }
 
+// A collector may answer with any body, a page of HTML included. Whatever is not understood counts
+// as no rejection: the status has already said that the batch was taken.
 PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {
   const auto json = nlohmann::json::parse(answer, nullptr, false);
   if (!json.is_object()) return {};

@@ -165,6 +165,8 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
     variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
     return;
   }
+  // As OpenTelemetry has it: a path is appended to the address of the collector for all signals,
+  // and the address for logs is taken as it stands.
   settings.url = endpoint->value;
   if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
     while (settings.url.ends_with('/')) settings.url.pop_back();
@@ -192,6 +194,7 @@ void readCredentials(Variables& variables, ForwarderSettings& settings) {
   if (const auto text = readSmallFile(*directory + "/otlp-headers", kMaxCredentialBytes)) {
     addHeaders(variables, settings, "otlp-headers in CREDENTIALS_DIRECTORY", trimmed(*text));
   }
+  // A path in a variable wins over the credential.
   const auto useFile = [&](std::string& target, const char* name) {
     std::error_code ignored;
     const std::string path = *directory + "/" + name;

@@ -1,4 +1,8 @@
-// The forwarder: reads the spool and ships it, and nothing else.
+// The program statora_forwarder: reads the spool and sends it to a collector.
+//
+// It is a program of its own, under a user of its own, so that the service needs no network and the
+// network reaches nothing but the spool. A signal ends it between two transactions or in the middle
+// of a request; either way the rows of that request stay and go out again at the next start.
 
 #include <curl/curl.h>
 #include <signal.h>
@@ -31,7 +35,8 @@ double chance() {
   return std::uniform_real_distribution<double>(0, 1)(random);
 }
 
-// Prints the bodies of everything that waits, one a line, as they would be sent without a failure.
+// Prints the bodies of everything that waits, one a line: those that would be sent if no request
+// failed. It reads without leave to write, so that it can run beside the service and the forwarder.
 int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   const ForwarderOptions options;
   ForwarderState state(launch.stateDirectory);
@@ -60,7 +65,8 @@ int requeue(const std::string& stateDirectory) {
   return 0;
 }
 
-// Ends waiting and the request under way at SIGTERM and SIGINT.
+// At SIGTERM and SIGINT, ends every wait and the present request. A collector that hangs would
+// otherwise keep the process for the whole timeout.
 void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
   const auto queue = std::make_shared<WorkerQueue>("statora_forwarder signal queue");
   for (const int signalNumber : {SIGTERM, SIGINT}) {
@@ -88,7 +94,7 @@ int exitStatus(ForwarderOutcome outcome) {
   return EX_SOFTWARE;
 }
 
-// Tells the log, once for each, why nothing moves.
+// Tells the log why nothing moves. An outage of days gives one line and not one every 30 seconds.
 class Complaints {
  public:
   void tell(const std::string& words) {
@@ -127,7 +133,7 @@ class Service {
         collector_(collector) {}
 
   int runOnce() {
-    if (!state_.exists()) return 0;  // nothing was ever sent
+    if (!state_.exists()) return 0;  // the service has never sent anything
     ForwarderOptions options = optionsFor(settings_);
     options.maxAttempts = kAttemptsAtOnce;
     return exitStatus(attempt(options));
@@ -136,6 +142,7 @@ class Service {
   int runForEver() {
     manager_->ready();
     manager_->say("Waiting for its turn in the fleet");
+    // A fleet that starts at the same minute must not come to the collector in the same second.
     const std::chrono::duration<double> turn = settings_.spread * chance();
     bool stopped = clock_.wait(stop_, std::chrono::duration_cast<std::chrono::nanoseconds>(turn));
     while (!stopped) {
@@ -149,7 +156,9 @@ class Service {
   }
 
  private:
+  // With --once somebody else starts the next attempt. Eight wait five to ten minutes in all.
   static constexpr uint32_t kAttemptsAtOnce = 8;
+  // An operator has to put an address or a password right, which takes longer than a retry.
   static constexpr std::chrono::seconds kHold{300};
 
   static ForwarderOptions optionsFor(const ForwarderSettings& settings) {
@@ -187,7 +196,7 @@ class Service {
 
 int forward(const LaunchConfiguration& launch, const ForwarderSettings& settings, bool once) {
   curl_global_init(CURL_GLOBAL_DEFAULT);
-  // Used by the signal thread for as long as the process lives.
+  // Never deleted: the signal thread uses them for as long as the process lives.
   auto& stop = *new Semaphore(0);
   const auto encoder = settings.output->makeEncoder(
       readResourceFacts(launch.osReleasePath, settings.sendInstanceId));
