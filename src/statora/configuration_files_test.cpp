@@ -1,4 +1,4 @@
-// Observing configurations on real files.
+// Configurations: their JSON, what an observer is told, and files that change in every way.
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -14,6 +14,94 @@
 
 namespace tessel {
 namespace {
+
+TEST(ConfigurationJsonTest, NumbersKeepTheirKind) {
+  const struct {
+    const char* text;
+    Number number;
+  } cases[] = {
+      {"true", Number{true}},
+      {"false", Number{false}},
+      {"1", Number{int64_t{1}}},
+      {"-9223372036854775808", Number{std::numeric_limits<int64_t>::min()}},
+      {"18446744073709551615", Number{uint64_t{18446744073709551615u}}},
+      {"0.0", Number{0.0}},
+      {"18446744073709551616", Number{18446744073709551616.0}},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.text);
+    const auto configuration = parseConfiguration(std::string("{\"TaskedOn\":") + c.text + "}");
+    ASSERT_NE(configuration, nullptr);
+    const auto& dictionary = std::get<ConfigurationValue::Dictionary>(configuration->value);
+    EXPECT_EQ(std::get<Number>(dictionary.at("TaskedOn").value), c.number);
+  }
+}
+
+TEST(ConfigurationJsonTest, TheLastOfEqualKeysCounts) {
+  const auto configuration =
+      parseConfiguration("\n{\"a\":[1,null,\"\\u00fc\"],\"b\":{\"a\":2},\"a\":[[],{}, \"x\"]}\n");
+  ASSERT_NE(configuration, nullptr);
+  const auto& dictionary = std::get<ConfigurationValue::Dictionary>(configuration->value);
+  ASSERT_EQ(dictionary.size(), 2u);
+  const auto& list = std::get<ConfigurationValue::List>(dictionary.at("a").value);
+  ASSERT_EQ(list.size(), 3u);
+  EXPECT_TRUE(std::holds_alternative<ConfigurationValue::List>(list[0].value));
+  EXPECT_TRUE(std::holds_alternative<ConfigurationValue::Dictionary>(list[1].value));
+  EXPECT_EQ(std::get<std::string>(list[2].value), "x");
+  const auto& inner = std::get<ConfigurationValue::Dictionary>(dictionary.at("b").value);
+  EXPECT_EQ(std::get<Number>(inner.at("a").value), Number{int64_t{2}});
+}
+
+TEST(ConfigurationJsonTest, NonsenseIsNoConfiguration) {
+  const std::string deep(kMaxConfigurationDepth + 1, '[');
+  const std::string endless(1 << 20, '[');
+  for (const std::string& text :
+       {std::string(), std::string("{\"TaskedOn\":true"), std::string("{\"TaskedOn\":true}x"),
+        std::string("{}{}"), std::string("{'TaskedOn':true}"), std::string("{\"TaskedOn\":TRUE}"),
+        std::string("[1e999]"), std::string("[\"\xff\"]"), std::string("[1,]"),
+        std::string("{}\0", 3), deep + std::string(deep.size(), ']'), endless}) {
+    EXPECT_EQ(parseConfiguration(text), nullptr) << text.substr(0, 60);
+  }
+  const std::string allowed(kMaxConfigurationDepth, '[');
+  EXPECT_NE(parseConfiguration(allowed + std::string(allowed.size(), ']')), nullptr);
+}
+
+const ConfigurationFile kNone{false, {}};
+const ConfigurationFile kUnreadable{true, {}};
+ConfigurationFile holding(const char* text) { return {true, text}; }
+
+TEST(ConfigurationChangesTest, AbsenceIsToldWhenItLasts) {
+  const struct {
+    const char* what;
+    std::vector<ConfigurationFile> looks;
+    const char* told;  // a letter a look: c a configuration, a its absence, - nothing
+  } cases[] = {
+      {"never a file", {kNone, kNone, kNone}, "---"},
+      {"made, changed, touched", {kNone, holding("1"), holding("2"), holding("2")}, "-cc-"},
+      {"written slowly",
+       {holding(""), holding("{"), holding("{\"a\":"), holding("{\"a\":1}")},
+       "---c"},
+      {"rewritten slowly with what it held",
+       {holding("{}"), holding("{"), holding("{}"), holding("{")},
+       "c---"},
+      {"left half written", {holding("{"), holding("{"), holding("{")}, "-a-"},
+      {"gone for a moment", {holding("1"), kNone, holding("1")}, "c--"},
+      {"gone, then back as it was", {holding("1"), kNone, kNone, kNone, holding("1")}, "c-a-c"},
+      {"absent for one reason after another",
+       {holding("1"), kNone, kNone, kUnreadable, kUnreadable},
+       "c-a--"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    ConfigurationChanges changes;
+    std::string told;
+    for (const ConfigurationFile& seen : c.looks) {
+      const auto report = changes.look(seen);
+      told += !report ? '-' : report->configuration ? 'c' : 'a';
+    }
+    EXPECT_EQ(told, c.told);
+  }
+}
 
 using testing::TemporaryDirectory;
 
