@@ -43,7 +43,8 @@ class Variables {
     if (text && text->empty()) text.reset();
     return text;
   }
-  // OTEL_EXPORTER_OTLP_LOGS_<name>, else OTEL_EXPORTER_OTLP_<name>.
+  // OTEL_EXPORTER_OTLP_LOGS_<name>, or OTEL_EXPORTER_OTLP_<name> without it. The answer holds the
+  // full name, so that an error names the variable that the operator has set.
   std::optional<Variable> standard(const std::string& name) const {
     for (const char* prefix : {"OTEL_EXPORTER_OTLP_LOGS_", "OTEL_EXPORTER_OTLP_"}) {
       if (auto text = value(prefix + name)) return Variable{prefix + name, std::move(*text)};
@@ -53,10 +54,12 @@ class Variables {
   std::string path(const std::string& name) const {
     return standard(name).value_or(Variable{}).value;
   }
+  // Keeps the first error only: later ones often follow from it.
   void complain(const std::string& name, const std::string& text, const std::string& expected) {
     if (!error_) error_ = LaunchError{name, text, expected};
   }
-  // A whole number, at least `least`.
+  // A whole number from `least` to a year in seconds. A larger one is a typing mistake, and sums of
+  // such times are far from overflow.
   std::optional<int64_t> number(const std::string& name, int64_t least) {
     const auto text = value(name);
     if (!text) return {};
@@ -130,6 +133,8 @@ std::string urlPart(CURLU* url, CURLUPart part) {
   return text;
 }
 
+// Only what cannot mean another machine counts. Other names are not resolved, because their address
+// may change before the request.
 bool isLoopback(const std::string& host) {
   if (host == "localhost" || host == "[::1]") return true;
   in_addr address{};
@@ -188,6 +193,8 @@ void addHeaders(Variables& variables, ForwarderSettings& settings, const std::st
   settings.headers.insert(settings.headers.end(), headers->begin(), headers->end());
 }
 
+// $CREDENTIALS_DIRECTORY is the service manager's: files that only this service can read, gone when
+// it ends.
 void readCredentials(Variables& variables, ForwarderSettings& settings) {
   const auto directory = variables.value("CREDENTIALS_DIRECTORY");
   if (!directory) return;
@@ -229,6 +236,7 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     const EnvironmentReader& environment) {
   ForwarderSettings settings;
   Variables variables(environment);
+  // The format comes first, because the endpoint's path depends on it.
   settings.output = readOutput(variables);
   readEndpoint(variables, settings);
   readTransport(variables, settings);

@@ -30,6 +30,7 @@ struct Arguments {
   bool requeue = false;
 };
 
+// Not reproducible on purpose: machines of a fleet that drew the same numbers would come together.
 double chance() {
   static std::mt19937_64 random{std::random_device{}()};
   return std::uniform_real_distribution<double>(0, 1)(random);
@@ -53,6 +54,7 @@ int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   }
 }
 
+// Works beside a running forwarder: the rows move in one transaction.
 int requeue(const std::string& stateDirectory) {
   ForwarderState state(stateDirectory);
   SqliteStatus status = state.open();
@@ -79,6 +81,8 @@ void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
   }
 }
 
+// From sysexits.h, so that a timer or a script can tell "try again" (75) from "put something
+// right".
 int exitStatus(ForwarderOutcome outcome) {
   switch (outcome) {
     case ForwarderOutcome::delivered:
@@ -219,6 +223,7 @@ int run(const Arguments& arguments) {
   static LogSink* const sink =
       makeLogSink(configuration.logDestination, "statora_forwarder").release();
   setLogSink(sink, configuration.logLevel);
+  // Neither of these two needs a collector, so the settings that name one are not read for them.
   if (arguments.requeue) return requeue(configuration.stateDirectory);
   if (arguments.dryRun) {
     const auto output = readOutputFormat(environment);
