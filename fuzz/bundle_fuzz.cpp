@@ -11,7 +11,7 @@
 #include <string>
 #include <string_view>
 
-#include "linux/AppBundles.h"
+#include "linux/SystemFacts.h"
 
 namespace {
 

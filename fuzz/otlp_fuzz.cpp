@@ -8,7 +8,7 @@
 #include <string_view>
 
 #include "forwarder/Encoder.h"
-#include "forwarder/Policy.h"
+#include "forwarder/Forwarder.h"
 #include "platform/Text.h"
 
 namespace {

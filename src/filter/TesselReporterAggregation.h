@@ -14,7 +14,7 @@
 #include <vector>
 
 #include "platform/FlatIndex.h"
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

@@ -1,6 +1,6 @@
 // Verdicts, waits and pace.
 
-#include "forwarder/Policy.h"
+#include "forwarder/Forwarder.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,5 @@
-// What this machine says about itself: its clocks, build variant, root volume and dates.
+// What this machine says about itself and its applications: clocks, build variant, root volume,
+// dates, and the identifiers of bundles.
 
 #pragma once
 
@@ -66,6 +67,22 @@ class IcuDates final : public DateFormatter {
  private:
   const std::string locale_;
   const std::optional<std::string> timeZone_;
+};
+
+// AppBundles: the identifier of an application's directory.
+//
+// The identifier is the AppStream component id in the one metadata file of the directory's
+// usr/share/metainfo (*.metainfo.xml, *.appdata.xml). If there is no such file, it is the name of
+// the one *.desktop file at the directory's root, provided that the name has reverse-DNS form. A
+// directory with several files of a kind has no identifier. Neither has one whose metadata file is
+// over 1 MiB, not well-formed, or without a valid id; a desktop file beside it does not help then.
+//
+// Strangers made these files. Links to files are followed, only regular files are opened, and
+// entities of an XML file are not expanded. Stateless; any thread.
+
+class AppBundles final : public BundleReader {
+ public:
+  std::optional<std::string> bundleIdentifier(const std::string& directory) override;
 };
 
 }  // namespace tessel

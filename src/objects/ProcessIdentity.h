@@ -12,8 +12,8 @@
 #include <string>
 #include <unordered_map>
 
-#include "platform/SharedString.h"
 #include "platform/System.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

@@ -18,8 +18,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Payload.h"
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

@@ -11,9 +11,9 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Payload.h"
 #include "platform/Queues.h"
 #include "platform/System.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

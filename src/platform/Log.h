@@ -19,7 +19,7 @@
 #include <type_traits>
 #include <variant>
 
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

@@ -4,7 +4,7 @@
 
 #include <limits>
 
-#include "platform/Payload.h"
+#include "platform/Values.h"
 
 namespace tessel {
 namespace {

@@ -2,8 +2,8 @@
 
 #pragma once
 
-#include "platform/SharedString.h"
 #include "platform/System.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

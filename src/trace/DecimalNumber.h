@@ -5,7 +5,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Payload.h"
+#include "platform/Values.h"
 
 namespace tessel {
 

@@ -21,8 +21,7 @@
 
 #include "journal/EntryStream.h"
 #include "platform/FlatIndex.h"
-#include "platform/Payload.h"
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 #include "trace/TracePointFields.h"
 
 namespace tessel {

@@ -10,7 +10,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 #include "whitelist/WhitelistLists.h"
 
 namespace tessel {

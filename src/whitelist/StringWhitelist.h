@@ -11,8 +11,8 @@
 #include <vector>
 
 #include "platform/FlatIndex.h"
-#include "platform/SharedString.h"
 #include "platform/System.h"
+#include "platform/Values.h"
 #include "whitelist/PlatformProfile.h"
 
 namespace tessel {

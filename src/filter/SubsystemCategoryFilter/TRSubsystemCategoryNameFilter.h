@@ -22,7 +22,7 @@
 
 #include "objects/TesselObject.h"
 #include "platform/Analytics.h"
-#include "platform/SharedString.h"
+#include "platform/Values.h"
 #include "whitelist/PlatformProfile.h"
 
 namespace tessel {

@@ -9,7 +9,6 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
-#include "linux/AppBundles.h"
 #include "linux/SystemFacts.h"
 #include "platform/Text.h"
 #include "service/BootVolume.h"

@@ -1,3 +1,21 @@
+// The values that travel from a trace point to an event: shared strings, numbers and payloads.
+
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <variant>
+#include <vector>
+
+#include "platform/FlatIndex.h"
+#include "platform/Json.h"
+
+namespace tessel {
+
 // SharedString, StringRef, StringPool: immutable text that carries its hash and may be absent.
 //
 // A text is stored once, in a reference-counted record that also holds its hash. SharedString owns
@@ -9,19 +27,6 @@
 //
 // Threads: records are immutable and their count is atomic, so handles may be copied and read
 // anywhere. A StringPool is used by one thread at a time while it grows.
-
-#pragma once
-
-#include <atomic>
-#include <cstddef>
-#include <cstdint>
-#include <string>
-#include <string_view>
-#include <vector>
-
-#include "platform/FlatIndex.h"
-
-namespace tessel {
 
 // 64-bit hash of `text`, seeded once per process, so that a writer cannot choose collisions.
 uint64_t hashText(std::string_view text);
@@ -144,5 +149,43 @@ class StringPool {
   FlatIndex index_;  // of strings_
   size_t textBytes_ = 0;
 };
+
+// Number and Payload: what an analytics event carries.
+//
+// Both are plain values. A payload is completed on one thread and then shared unchanged.
+
+// A number that keeps its kind from the recording application to the event. Booleans are numbers; a
+// 32-bit float stays one; an unsigned 64-bit number never passes through a double.
+using Number = std::variant<bool, int64_t, uint64_t, float, double>;
+
+// False for false, 0 and 0.0; true for every other number.
+bool booleanValue(const Number& number);
+// The number as JSON has it: the shortest decimal text that reads back as the same number of its
+// kind, "true" or "false" for a boolean, "null" for a number that is not finite.
+std::string numberText(const Number& number);
+
+// A flat dictionary: keys to strings or numbers, in the order in which the keys were first set.
+class Payload {
+ public:
+  using Value = std::variant<SharedString, Number>;
+  // Keys are literals: the views given to set() must outlive the payload.
+  using Entry = std::pair<std::string_view, Value>;
+
+  // Storing an absent string leaves the key out, or as it was.
+  void set(std::string_view key, SharedString value);
+  void set(std::string_view key, Number value);
+  // The value under `key`; null where there is none.
+  const Value* find(std::string_view key) const;
+  const std::vector<Entry>& entries() const { return entries_; }
+
+ private:
+  void store(std::string_view key, Value value);
+
+  std::vector<Entry> entries_;
+};
+
+// The payload as one JSON object, keys in payload order. Bytes of a string that are not
+// valid UTF-8 become U+FFFD, one for each maximal invalid part.
+std::string payloadJson(const Payload& payload, JsonStyle style = {});
 
 }  // namespace tessel
