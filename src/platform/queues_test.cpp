@@ -22,7 +22,10 @@ TEST(WorkerQueueTest, RunsOneAtATimeInOrder) {
   for (auto& order : orders) {
     threads.emplace_back([&queue, &order, &count] {
       for (int i = 0; i < kEach; ++i)
-        queue.async([&order, &count, i] { order.push_back(i), ++count; });
+        queue.async([&order, &count, i] {
+          std::this_thread::yield();  // gives a second thread of the queue its chance
+          order.push_back(i), ++count;
+        });
     });
   }
   for (std::thread& thread : threads) thread.join();
