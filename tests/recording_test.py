@@ -120,6 +120,7 @@ class InsideDaemon(MachineTest):
         fields = ("MESSAGE=tessel\nTESSEL_KIND=event\nTESSEL_SUBSYSTEM=com.vantor.Calendar\nTESSEL_CATEGORY=View\n"
                   "TESSEL_NAME=Logged\nTESSEL_TELEMETRY=1\n")
         subprocess.run(["logger", "--journald"], input=fields, text=True, check=True)
+        subprocess.run(["journalctl", "--sync"], check=True)  # the daemon may not have written the last entries yet
         self.run_clean(TESSEL_TRACE_STORE=None)
         self.assertEqual(sent(self.machine), expected + [("Event", "Logged")])
         self.log_to_the_journal(len(expected) + 1)
