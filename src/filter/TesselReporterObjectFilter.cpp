@@ -58,6 +58,7 @@ std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::init(
 
 std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::initWithPlatform(
     TesselReporterPlatform platform, BuildVariant& variant) {
+  // Nobody knows what may leave a platform that nobody knows.
   if (platform == TesselReporterPlatform::unknown) return nullptr;
   return std::shared_ptr<TesselReporterObjectFilter>(
       new TesselReporterObjectFilter(platform, variant));
@@ -127,6 +128,7 @@ bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& ob
 bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& object,
                                                           FilterDecision& decision) const {
   if (scnFilter_ == nullptr) return true;
+  // Not shouldReportObject(), which does not tell which entry decided.
   TRDownsampleEntry* entry = scnFilter_->downsampleEntryForObject(object);
   decision.downsampleEntry = entry;
   return entry == nullptr || entry->shouldReportThisTime();
@@ -135,14 +137,17 @@ bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& ob
 void TesselReporterObjectFilter::incrementTotalForObject(
     const TesselSupportObject& object, TesselReporterClassification classification) {
   const TesselObject* point = asTesselObject(object);
+  // What is no trace point has neither name, and still counts as inspected.
   const StringRef subsystem = point ? point->subsystem() : StringRef();
   const StringRef category = point ? point->category() : StringRef();
 
+  // Every object goes into the first and into one of the others, so those sum up to the first.
   allInspected_.incrementSubsystem(subsystem, category);
   if (classification < classified_.size())
     classified_[classification].incrementSubsystem(subsystem, category);
 
   const bool reported = classification == TesselReporterClassificationTelemetryReported;
+  // The most derived class first, because an animation interval is an interval, too.
   if (object.isKindOf(TesselClass::animationInterval)) {
     animations_.count(reported);
   } else if (object.isKindOf(TesselClass::interval)) {

@@ -38,7 +38,7 @@ std::vector<std::string> descriptions(const TesselReporterAggregation& aggregati
   return texts;
 }
 
-TEST(AggregationKeyTest, EqualOnlyWhereAllFourStringsArePresentAndEqual) {
+TEST(AggregationKeyTest, KeysWithAbsentStringsDiffer) {
   const struct {
     Key a, b;
     bool equal;
@@ -79,7 +79,7 @@ TEST(AggregationTest, OrdersByCountThenByFirstAppearance) {
   EXPECT_EQ(aggregation.countForKey(key("x", "a")), 0u);
 }
 
-TEST(AggregationTest, APairWithAnAbsentStringIsANewEntryEachTime) {
+TEST(AggregationTest, AnAbsentStringMakesANewEntry) {
   TesselReporterAggregation aggregation;
   increment(aggregation, "s", "c");
   for (int i = 0; i < 2; ++i) {
@@ -102,7 +102,7 @@ TEST(AggregationTest, APairWithAnAbsentStringIsANewEntryEachTime) {
   }
 }
 
-TEST(AggregationTest, PairsWithAnAbsentStringDoNotCrowdOutTheOthers) {
+TEST(AggregationTest, AbsentStringsDoNotCrowdTheOthers) {
   TesselReporterAggregation aggregation;
   for (int i = 0; i < 200; ++i) increment(aggregation, nullptr, "c");
   for (int i = 0; i < 40; ++i) increment(aggregation, "s", std::to_string(i % 20).c_str());

@@ -60,7 +60,7 @@ std::optional<uint64_t> capAt(const TRSubsystemCategoryNameFilter& filter, const
   return entry ? std::optional(entry->cap()) : std::nullopt;
 }
 
-TEST(DownsamplingFilterTest, AConfigurationRowThatLacksAValueMakesNoFilter) {
+TEST(DownsamplingTest, ARowThatLacksAValueMakesNoFilter) {
   const Path path{"S", {}, {}};
   const auto good = row(path, whole(1), whole(1));
   const struct {
@@ -85,7 +85,7 @@ TEST(DownsamplingFilterTest, AConfigurationRowThatLacksAValueMakesNoFilter) {
   EXPECT_TRUE(log.lines().empty());
 }
 
-TEST(DownsamplingFilterTest, ARowWithARatioOfZeroIsSkipped) {
+TEST(DownsamplingTest, ARowWithARatioOfZeroIsSkipped) {
   const testing::RecordingLog log;
   const auto filter =
       filterOf({row({"S", {}, {}}, whole(1), whole(0)), row({"T", {}, {}}, whole(5), whole(1))});
@@ -96,7 +96,7 @@ TEST(DownsamplingFilterTest, ARowWithARatioOfZeroIsSkipped) {
             std::vector<std::string>{"Tried to create a downsample entry with 0 downsample ratio"});
 }
 
-TEST(DownsamplingFilterTest, NumbersOfAnyKindAreReadAsUnsigned) {
+TEST(DownsamplingTest, NumbersOfAnyKindAreReadAsUnsigned) {
   constexpr uint64_t kMost = std::numeric_limits<uint64_t>::max();
   const struct {
     Number cap;
@@ -157,7 +157,7 @@ class NaiveDownsampling {
   std::vector<Row> rows_;
 };
 
-TEST(DownsamplingFilterTest, LongSequencesAgreeWithANaiveFormulation) {
+TEST(DownsamplingTest, AgreesWithANaiveFormulation) {
   std::mt19937 random(503);
   const auto anyText = [&random](const char* prefix, bool mayBeAbsent) -> Text {
     const auto pick = random() % 4;
@@ -190,7 +190,7 @@ struct TierWithoutOperations : FilterTier {
   TierWithoutOperations() : FilterTier(nullptr) {}
 };
 
-TEST(FilterTierDeathTest, AbstractOperationsStopTheProcess) {
+TEST(FilterTierDeathTest, AbstractOperationsAbort) {
   const FilterQuery query({}, {}, {});
   const ::testing::KilledBySignal aborted(SIGABRT);
   EXPECT_EXIT(
@@ -203,7 +203,7 @@ TEST(FilterTierDeathTest, AbstractOperationsStopTheProcess) {
       "tessel_reporter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter, line 127\\.\n$");
 }
 
-TEST(DefaultDownsamplingTest, SelvinAndQuarroHaveAFilterForTheLifeOfTheProcess) {
+TEST(DefaultDownsamplingTest, EachPlatformHasOneFilter) {
   using Platform = TesselReporterPlatform;
   for (const Platform platform : {Platform::selvin, Platform::quarro}) {
     const auto filter = defaultFilterForPlatform(platform);

@@ -15,7 +15,7 @@ struct OrdinaryBuild final : BuildVariant {
   bool hasInternalDiagnostics(std::string_view) override { return false; }
 };
 
-TEST(FilterCostTest, DecidingAboutKnownPairsAllocatesNothing) {
+TEST(FilterCostTest, AKnownPairAllocatesNothing) {
   OrdinaryBuild variant;
   const auto filter = TesselReporterObjectFilter::init(variant);
   filter->setScnFilter(makeDefaultFilterForPlatform(TesselReporterPlatform::selvin));

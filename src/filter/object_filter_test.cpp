@@ -102,7 +102,7 @@ TEST_F(ObjectFilterTest, OnlyADurationBelowZeroIsTooShort) {
   }
 }
 
-TEST_F(ObjectFilterTest, DownsamplingIsAskedOnlyAboutWhatPassedEverythingElse) {
+TEST_F(ObjectFilterTest, DownsamplingIsAskedLast) {
   const auto held = faultyObject({kDownsampling});
   const auto* entry = filter->scnFilter()->downsampleEntryForObject(*held);
   for (const Fault fault : {kClass, kTelemetry, kDuration, kString}) {
@@ -147,7 +147,7 @@ TestPoint perfLoggingPoint(TestPoint::Text component, TestPoint::Text action) {
   return point;
 }
 
-TEST_F(ObjectFilterTest, QuarroHasARuleOfItsOwnOnEveryBuild) {
+TEST_F(ObjectFilterTest, QuarroHasARuleOnEveryBuild) {
   const struct {
     TestPoint::Text component, action;
     int failingSlot;  // 0 where it passes
@@ -173,7 +173,7 @@ TEST_F(ObjectFilterTest, QuarroHasARuleOfItsOwnOnEveryBuild) {
   }
 }
 
-TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
+TEST_F(ObjectFilterTest, TheSpecialRuleExemptsFromTheList) {
   TestPoint point = perfLoggingPoint("ApplicationWindow", "Open");
   point.strings[0].first = "component";
   point.strings[1].first = "action";
@@ -186,7 +186,7 @@ TEST_F(ObjectFilterTest, PassingTheSpecialRuleExemptsFromTheWhitelist) {
   EXPECT_TRUE(makeFilter(Platform::quarro)->shouldReportTesselObject(*makeEvent(point), nullptr));
 }
 
-TEST_F(ObjectFilterTest, ASlotIsTestedOnlyWhereItIsLabelled) {
+TEST_F(ObjectFilterTest, OnlyALabelledSlotIsTested) {
   const struct {
     TestPoint::Text label1, value1, label2, value2;
     bool passes;
@@ -210,7 +210,7 @@ TEST_F(ObjectFilterTest, ASlotIsTestedOnlyWhereItIsLabelled) {
   }
 }
 
-TEST_F(ObjectFilterTest, ACodeOutsideTheEnumerationIsInspectedAndNotReported) {
+TEST_F(ObjectFilterTest, AnUnknownCodeCountsAsNotReported) {
   filter->incrementTotalForObject(*makeInterval({}), static_cast<TesselReporterClassification>(6));
   EXPECT_EQ(filter->allInspectedTesselObjectsAggregation().totalCount(), 1u);
   EXPECT_EQ(filter->totalUnreportedIntervalCount(), 1u);
@@ -231,7 +231,7 @@ TestPoint anyPoint(std::mt19937& random) {
   return point;
 }
 
-TEST_F(ObjectFilterTest, EveryObjectIsCountedUnderItsReasonAndItsKind) {
+TEST_F(ObjectFilterTest, CountsByReasonAndByKind) {
   const std::function<std::shared_ptr<const TesselObject>(const TestPoint&)> makers[] = {
       makeEvent, makeInterval, makeAnimationInterval, makeObject};
   std::mt19937 random(20261122);

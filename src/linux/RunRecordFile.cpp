@@ -111,8 +111,7 @@ RunRecord recordFrom(const Json& json) {
   record.failure = json.at("failure").get<std::string>();
   record.logEvents = countAt(json, "log_events");
   record.inspected = countAt(json, "inspected");
-  record.classified =
-      json.at("classified").get<std::array<uint64_t, RunRecord::kClassifications>>();
+  record.classified = json.at("classified").get<ClassifiedCounts>();
   record.unnamed = countAt(json, "unnamed");
   record.countEvents = countAt(json, "count_events");
   if (hasReading(json)) record.reading = readingFrom(json.at("reading"));

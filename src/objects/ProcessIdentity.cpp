@@ -42,7 +42,7 @@ std::string_view bundleDirectoryAbove(std::string_view imagePath) {
   const std::string prefix = std::string(lastComponent(imagePath)) + ".";
   std::string_view directory = parent(imagePath);
   for (int examined = 0; examined < kExaminedDirectoriesLimit; ++examined) {
-    // The parent of "/" is "/", so the walk would never end by itself.
+    // The parent of "/" is "/", so going on would only use up the limit.
     if (directory.empty() || directory == "/") return {};
     if (lastComponent(directory).starts_with(prefix)) return directory;
     directory = parent(directory);

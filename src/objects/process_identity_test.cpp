@@ -20,7 +20,7 @@ class ProcessIdentityTest : public ::testing::Test {
   ProcessIdentity identity{bundles};
 };
 
-TEST_F(ProcessIdentityTest, TheNearestDirectoryNamedAfterTheImageDecides) {
+TEST_F(ProcessIdentityTest, TheNearestNamedDirectoryWins) {
   const struct {
     const char* path;
     const char* bundle;
@@ -47,7 +47,7 @@ TEST_F(ProcessIdentityTest, TheNearestDirectoryNamedAfterTheImageDecides) {
   }
 }
 
-TEST_F(ProcessIdentityTest, NothingIsOpenedButTheDirectoryThatIsNamedAfterTheImage) {
+TEST_F(ProcessIdentityTest, OpensOnlyADirectoryWithItsName) {
   lookUp("/opt/lib/tool");
   lookUp("/Foo");
   EXPECT_TRUE(bundles.asked.empty());
@@ -55,7 +55,7 @@ TEST_F(ProcessIdentityTest, NothingIsOpenedButTheDirectoryThatIsNamedAfterTheIma
   EXPECT_EQ(bundles.asked, std::vector<std::string>{"/a/Foo.app/Foo.b"});
 }
 
-TEST_F(ProcessIdentityTest, OnlyTheFirstHundredDirectoriesAreExamined) {
+TEST_F(ProcessIdentityTest, LooksAHundredDirectoriesUp) {
   bundles.identifiers["/Foo.app"] = "bundle";
   const auto imageBelow = [](int directories) {
     std::string path = "/Foo.app";
@@ -66,7 +66,7 @@ TEST_F(ProcessIdentityTest, OnlyTheFirstHundredDirectoriesAreExamined) {
   EXPECT_EQ(lookUp(imageBelow(100)), "none");
 }
 
-TEST_F(ProcessIdentityTest, EveryAnswerIsKeptAndOnlyAFindIsLogged) {
+TEST_F(ProcessIdentityTest, KeepsAnswersAndLogsFinds) {
   const testing::RecordingLog log;
   bundles.identifiers["/x/Foo.app"] = "com.vantor.Foo";
   for (int i = 0; i < 2; ++i) {

@@ -15,7 +15,7 @@ using testing::makeInterval;
 using testing::makeObject;
 using testing::TestPoint;
 
-class StatoraReportingTest : public ::testing::Test {
+class PayloadTest : public ::testing::Test {
  protected:
   std::string json(const TesselSupportObject& object) {
     const auto payload = object.statoraPayload(identity);
@@ -26,7 +26,7 @@ class StatoraReportingTest : public ::testing::Test {
   ProcessIdentity identity{bundles};
 };
 
-TEST_F(StatoraReportingTest, EveryValueOfAnEventStandsUnderItsKeyInOrder) {
+TEST_F(PayloadTest, EachValueStandsUnderItsKeyInOrder) {
   TestPoint point;
   point.strings = {{{"period", "week"}, {"size", "small"}}};
   point.numbers = {{{"count", uint64_t{18446744073709551615u}}, {"share", 0.1}}};
@@ -41,7 +41,7 @@ TEST_F(StatoraReportingTest, EveryValueOfAnEventStandsUnderItsKeyInOrder) {
       R"("IntervalType":"Event","DurationInSeconds":0.1,"StartProcessName":"Calendar"})");
 }
 
-TEST_F(StatoraReportingTest, AbsentValuesAreLeftOutOrUnknown) {
+TEST_F(PayloadTest, AbsentValuesAreLeftOutOrUnknown) {
   TestPoint point;
   point.subsystem = point.category = point.name = {};
   // A value without its label, and a label without its value.
@@ -61,7 +61,7 @@ TEST_F(StatoraReportingTest, AbsentValuesAreLeftOutOrUnknown) {
   EXPECT_EQ(json(TesselSupportObject()), "none");
 }
 
-TEST_F(StatoraReportingTest, BeginAndEndOfAnIntervalAreNamedEachByItself) {
+TEST_F(PayloadTest, BeginAndEndHaveNamesOfTheirOwn) {
   bundles.identifiers["/apps/Clock.app"] = "com.vantor.Clock";
   TestPoint point;
   point.beginImagePath = "/apps/Clock.app/Clock";
@@ -82,7 +82,7 @@ TEST_F(StatoraReportingTest, BeginAndEndOfAnIntervalAreNamedEachByItself) {
       R"("StartProcessName":"com.vantor.Clock","EndProcessName":"Unknown","FrameRate":59.94})");
 }
 
-TEST_F(StatoraReportingTest, TheOverrideIsTakenWhereItIsMeant) {
+TEST_F(PayloadTest, TheOverrideIsTakenWhereItIsMeant) {
   const struct {
     TestPoint::Text subsystem, category;
     bool taken;
@@ -116,7 +116,7 @@ TEST_F(StatoraReportingTest, TheOverrideIsTakenWhereItIsMeant) {
   }
 }
 
-TEST(TesselClassTest, AnObjectIsOfItsClassAndOfThoseItDerivesFrom) {
+TEST(TesselClassTest, AnObjectIsOfItsBaseClassesToo) {
   using Answers = std::vector<bool>;  // support object, object, event, interval, animation interval
   const auto answersOf = [](const TesselSupportObject& object) {
     Answers answers;

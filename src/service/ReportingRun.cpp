@@ -4,17 +4,22 @@
 
 #include "platform/Invariant.h"
 #include "platform/Log.h"
-#include "service/BootVolume.h"
 
 namespace tessel {
 
 namespace {
 
+constexpr char kTransactionName[] = "com.vantor.tessel.tessel_reporter_activity transaction";
+
+// A day, as long as the interval between two runs. A run that comes late leaves a gap, one that
+// comes early reports some trace points twice: which ones were read is not kept anywhere.
 constexpr std::chrono::seconds kLookBack{86400};
+
+// Whoever asks for a deferral waits for us this long at most, plus the leeway.
 constexpr std::chrono::nanoseconds kPollInterval{10'000'000'000};
 constexpr std::chrono::nanoseconds kPollLeeway{10'000'000'000};
 
-void pollDeferral(Activity& activity, std::atomic<bool>& interruptedByDeferral,
+void pollDeferral(Activity& activity, std::atomic<bool>& interrupted,
                   const std::weak_ptr<TesselSupportObjectExtractor>& extractor) {
   if (!activity.shouldDefer()) {
     tesselReporterLog().debug("Deferral not requested, continuing.");
@@ -22,7 +27,7 @@ void pollDeferral(Activity& activity, std::atomic<bool>& interruptedByDeferral,
   }
   tesselReporterLog().debug("Trying to stop in-flight reporting work.");
   if (const auto running = extractor.lock()) running->stopProcessing();
-  interruptedByDeferral = true;
+  interrupted = true;
   tesselReporterLog().debug("Concluding processing due to deferral request");
 }
 
@@ -33,110 +38,159 @@ RunRecord endedWith(RunOutcome outcome, std::string failure = {}) {
   return record;
 }
 
-void addObjects(RunRecord& record, const TesselReporterObjectFilter& filter) {
-  record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
-  record.classified = filter.classifiedCounts();
-  // Each object that was inspected was reported or held back for exactly one reason.
-  TESSEL_INVARIANT(record.objectsBalance());
-}
-
-}  // namespace
-
-void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity) {
-  const Date began = surroundings_.clock.now();
-  RunRecord record = attempt(activity);
-  record.start = began;
-  record.end = surroundings_.clock.now();
-  surroundings_.status.say("idle");
-  runEnded_(record);
-}
-
-RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
-  surroundings_.status.say("waiting for the tasking configuration");
-  if (!gate_.shouldReport()) return endedWith(RunOutcome::notTasked);
-  if (cookie_.cookieFileExists()) {
-    tesselReporterLog().debug("Bailing due to cookie file");
-    cookie_.clearCookieFile();
-    return endedWith(RunOutcome::bailedOut);
-  }
-  if (!cookie_.createCookieFile())
-    return endedWith(RunOutcome::failed, "the run marker could not be made");
-  RunRecord reported = report(activity);
-  cookie_.clearCookieFile();
-  return reported;
-}
-
-RunRecord ReportingRun::report(const std::shared_ptr<Activity>& activity) {
-  Clock& clock = surroundings_.clock;
-  const uint64_t startTime = clock.continuousTicks();
-  const auto extractor = makeExtractor_();
-  const auto filter = TesselReporterObjectFilter::init(surroundings_.buildVariant);
-  const auto reporter = makeObjectReporter(filter);
-  installCallbacks(*extractor, reporter);
-  extractor->setBuildAnimationCompositeIntervalTimelines(false);
-  const auto interruptedByDeferral = std::make_shared<std::atomic<bool>>(false);
-  const Date startDate = clock.now() - kLookBack;
-  const Date endDate = clock.now();
-  startDeferralPoll(activity, interruptedByDeferral, extractor);
-  surroundings_.status.say("reading the trace store");
-  const auto failure = extract(*extractor, startDate, endDate);
-  surroundings_.status.say("summarising");
-  RunRecord record =
-      endedWith(failure ? RunOutcome::failed : RunOutcome::completed, failure.value_or(""));
-  road_.reportingQueue.sync([&] {
-    record.countEvents = summary_.reportRunSummary(*filter, *extractor, startDate, endDate,
-                                                   *interruptedByDeferral, startTime);
-  });
-  // A deferral may come as late as during the summary; it is asked for last.
-  if (!failure && *interruptedByDeferral) record.outcome = RunOutcome::interrupted;
-  record.logEvents = extractor->processedEventCount();
-  record.reading = extractor->reading();
-  record.unnamed = reporter->unnamedCount();
-  addObjects(record, *filter);
-  return record;
-}
-
-std::shared_ptr<ObjectReporter> ReportingRun::makeObjectReporter(
-    const std::shared_ptr<TesselReporterObjectFilter>& filter) {
-  SharedString filesystem = bootFilesystemType(surroundings_.volumes);
-  const SharedString disk(bootDiskType);
-  auto reporter = std::make_shared<ObjectReporter>(road_, filter, std::move(filesystem), disk);
-  tesselReporterLog().debug("Boot disk type: %@", disk);
-  return reporter;
-}
-
-void ReportingRun::installCallbacks(TesselSupportObjectExtractor& extractor,
-                                    const std::shared_ptr<ObjectReporter>& reporter) {
-  const auto reportTesselObject = [reporter, &status = surroundings_.status](
-                                      const std::shared_ptr<const TesselObject>& object) {
-    status.progress();
-    return reporter->reportTesselObject(object);
-  };
-  extractor.setIntervalCompletionProcessingBlock(reportTesselObject);
-  extractor.setAnimationIntervalCompletionProcessingBlock(reportTesselObject);
-  extractor.setEmitEventProcessingBlock(reportTesselObject);
-}
-
-void ReportingRun::startDeferralPoll(
-    const std::shared_ptr<Activity>& activity, const InterruptedCell& interruptedByDeferral,
-    const std::shared_ptr<TesselSupportObjectExtractor>& extractor) {
-  const auto queue = surroundings_.queues.makeSerialQueue("tessel_reporter defer polling queue");
-  const std::weak_ptr<TesselSupportObjectExtractor> weakExtractor = extractor;
-  surroundings_.queues
-      .makeRepeatingTimer(queue, kPollInterval, kPollLeeway,
-                          [activity, interruptedByDeferral, weakExtractor] {
-                            pollDeferral(*activity, *interruptedByDeferral, weakExtractor);
-                          })
-      ->resume();
-}
-
-std::optional<std::string> ReportingRun::extract(TesselSupportObjectExtractor& extractor,
-                                                 Date startDate, Date endDate) {
+// Why the extraction failed, in words; absent if it did not.
+std::optional<std::string> extract(TesselSupportObjectExtractor& extractor, Date startDate,
+                                   Date endDate) {
   std::optional<PlatformError> error;
   if (extractor.processLogArchiveWithPath(std::nullopt, startDate, endDate, error)) return {};
   std::string description = error ? error->words : "Unknown error";
   tesselReporterLog().debug("Failed to process tessel data due to error: %@", description);
   return description;
+}
+
+}  // namespace
+
+bool CookieFile::cookieFileExists() {
+  const FileExistence found = files_.existence(cookieFilePath);
+  if (found.exists && found.isDirectory)
+    tesselReporterLog().debug("Cookie file exists but is directory");
+  return found.exists;
+}
+
+void CookieFile::clearCookieFile() {
+  if (!cookieFileExists()) return;
+  const RemovalResult result = files_.remove(cookieFilePath);
+  if (result.removed) {
+    tesselReporterLog().debug("Cleared cookie file");
+  } else {
+    // An error, because the next run will take the marker for that of a run that died.
+    tesselReporterLog().error("Could not clear cookie file: %@",
+                              result.error.value_or("Unknown error"));
+  }
+}
+
+bool CookieFile::createCookieFile() {
+  if (cookieFileExists()) return false;
+  if (!files_.createFile(cookieFilePath)) {
+    tesselReporterLog().debug("Could not create cookie file");
+    return false;
+  }
+  tesselReporterLog().debug("Created cookie file");
+  return true;
+}
+
+std::shared_ptr<const std::atomic<bool>> DeferralPoll::start(
+    const std::shared_ptr<Activity>& activity,
+    const std::shared_ptr<TesselSupportObjectExtractor>& extractor) {
+  const auto interrupted = std::make_shared<std::atomic<bool>>(false);
+  const auto queue = queues_.makeSerialQueue("tessel_reporter defer polling queue");
+  // Weak, because the poll outlives the run, and an extractor holds the strings of a whole day.
+  const std::weak_ptr<TesselSupportObjectExtractor> weakExtractor = extractor;
+  queues_
+      .makeRepeatingTimer(queue, kPollInterval, kPollLeeway,
+                          [activity, interrupted, weakExtractor] {
+                            pollDeferral(*activity, *interrupted, weakExtractor);
+                          })
+      ->resume();
+  return interrupted;
+}
+
+RunRecord TraceReading::report(const std::shared_ptr<Activity>& activity) {
+  const uint64_t startTime = clock_.continuousTicks();
+  const auto extractor = makeExtractor_();
+  const auto reporter = makeReporter_();
+  const TesselReporterObjectFilter& filter = reporter->filter();
+  installCallbacks(*extractor, reporter);
+  extractor->setBuildAnimationCompositeIntervalTimelines(false);
+  const Date startDate = clock_.now() - kLookBack;
+  const Date endDate = clock_.now();
+  const auto interrupted = poll_.start(activity, extractor);
+  status_.say("reading the trace store");
+  const auto failure = extract(*extractor, startDate, endDate);
+  status_.say("summarising");
+  RunRecord record =
+      endedWith(failure ? RunOutcome::failed : RunOutcome::completed, failure.value_or(""));
+  // On the queue behind all sends of the run, so what it sums up has been sent before.
+  reportingQueue_.sync([&] {
+    record.countEvents =
+        summary_.reportRunSummary(filter, *extractor, startDate, endDate, *interrupted, startTime);
+  });
+  // A deferral may come as late as during the summary; it is asked for last.
+  if (!failure && *interrupted) record.outcome = RunOutcome::interrupted;
+  record.logEvents = extractor->processedEventCount();
+  record.reading = extractor->reading();
+  record.unnamed = reporter->unnamedCount();
+  record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
+  record.classified = filter.classifiedCounts();
+  // Each object that was inspected was reported or held back for exactly one reason.
+  TESSEL_INVARIANT(record.objectsBalance());
+  return record;
+}
+
+void TraceReading::installCallbacks(TesselSupportObjectExtractor& extractor,
+                                    const std::shared_ptr<ObjectReporter>& reporter) {
+  const auto reportTesselObject =
+      [reporter, &status = status_](const std::shared_ptr<const TesselObject>& object) {
+        // The service manager kills a service that shows no progress for too long.
+        status.progress();
+        return reporter->reportTesselObject(object);
+      };
+  extractor.setIntervalCompletionProcessingBlock(reportTesselObject);
+  extractor.setAnimationIntervalCompletionProcessingBlock(reportTesselObject);
+  extractor.setEmitEventProcessingBlock(reportTesselObject);
+}
+
+void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity) {
+  const Date began = clock_.now();
+  RunRecord record = attempt(activity);
+  record.start = began;
+  record.end = clock_.now();
+  status_.say("idle");
+  runEnded_(record);
+}
+
+RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
+  status_.say("waiting for the tasking configuration");
+  if (!gate_.shouldReport()) return endedWith(RunOutcome::notTasked);
+  if (cookie_.cookieFileExists()) {
+    // The run that left the marker may have died of what it read, so this run reads nothing. It
+    // takes the marker away, so that the next one does.
+    tesselReporterLog().debug("Bailing due to cookie file");
+    cookie_.clearCookieFile();
+    return endedWith(RunOutcome::bailedOut);
+  }
+  // Without a marker a run that dies would not be noticed, and the next would die the same way.
+  if (!cookie_.createCookieFile())
+    return endedWith(RunOutcome::failed, "the run marker could not be made");
+  RunRecord record = reading_.report(activity);
+  cookie_.clearCookieFile();
+  return record;
+}
+
+void ReporterActivity::handleActivity(const std::shared_ptr<Activity>& changed) {
+  // A share of our own: the activity must live until the transaction is closed.
+  // NOLINTNEXTLINE(performance-unnecessary-copy-initialization)
+  const std::shared_ptr<Activity> activity = changed;
+  const auto transaction = runtime_.openTransaction(kTransactionName);
+  const int64_t state = activity->state();
+  if (state == kActivityStateRun) {
+    runOrDefer(activity);
+  } else if (state == kActivityStateCheckIn) {
+    tesselReporterLog().debug("Checking in\n");
+  } else {
+    tesselReporterLog().debug("Unknown state %ld\n", state);
+  }
+  // Only asked for here: the process ends when the transaction is closed, not in the middle of it.
+  runtime_.requestCleanExit();
+}
+
+void ReporterActivity::runOrDefer(const std::shared_ptr<Activity>& activity) {
+  // If the scheduler does not take the deferral, nobody would start the run later, so it runs now.
+  if (activity->shouldDefer() && activity->setState(kActivityStateDefer)) {
+    tesselReporterLog().debug("Deferred tessel_reporter\n");
+    return;
+  }
+  run_.performReportingRun(activity);
 }
 
 }  // namespace tessel

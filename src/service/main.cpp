@@ -1,7 +1,8 @@
 // Composition root of the service: makes every part, in order, and hands each what it needs.
 //
-// What is made here is never destroyed, so that the process can end at any moment, from any thread,
-// while others work. Arguments are ignored; the environment is the launch configuration.
+// What is made here is never destroyed. The process may end at any moment and on any thread, and
+// the other threads must not meet a part that is half gone. Arguments are ignored; the environment
+// is the launch configuration.
 
 #include <csignal>
 #include <cstdio>
@@ -16,7 +17,7 @@
 #include "linux/StateDirectory.h"
 #include "linux/SystemFacts.h"
 #include "platform/Queues.h"
-#include "service/ReporterActivity.h"
+#include "service/ReportingRun.h"
 #include "statora/ConfigurationFiles.h"
 #include "statora/Spool.h"
 #include "trace/JournalExtractor.h"
@@ -24,8 +25,8 @@
 namespace tessel {
 namespace {
 
-// Makes a T that lives as long as the process. It stays reachable, so that a leak checker does not
-// take it for a leak.
+// Makes a T that lives as long as the process. A list keeps it reachable, because a leak checker
+// reports what nothing points to.
 template <typename T, typename... Args>
 T& keep(Args&&... args) {
   static auto& kept = *new std::deque<T*>;
@@ -73,30 +74,43 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
   spool.beginRun();
 }
 
-ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& state,
-                      SystemClock& clock, ServiceStatus& status, SerialQueue& reportingQueue) {
+// What is read, and the way of each object from the store to the spool.
+TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& variant, Spool& spool,
+                          QueueFactory& queues, SerialQueue& reportingQueue, Clock& clock,
+                          ServiceStatus& status) {
+  auto& throttle = keep<Throttle>(clock);
+  auto& road = keep<EventRoad>(throttle, spool, reportingQueue);
+  auto& identity = keep<ProcessIdentity>(keep<AppBundles>());
+  auto& volumes = keep<MountTable>();
+  auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
+  const auto makeExtractor = [store = launch.traceStore, &status] {
+    // Not make_shared(): the poll of a past run still has a weak reference, and that would hold the
+    // memory of the whole extractor.
+    std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store));
+    extractor->reportProgressTo(status);
+    return extractor;
+  };
+  const auto makeReporter = [&variant, &volumes, &identity, &road] {
+    return std::make_shared<ObjectReporter>(TesselReporterObjectFilter::init(variant),
+                                            bootVolumeFacts(volumes), identity, road);
+  };
+  return keep<TraceReading>(makeExtractor, makeReporter, keep<DeferralPoll>(queues), summary,
+                            reportingQueue, clock, status);
+}
+
+ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& state, Clock& clock,
+                      ServiceStatus& status, SerialQueue& reportingQueue) {
   auto& queues = keep<WorkerQueueFactory>();
   auto& variant = keep<OsReleaseBuildVariant>(launch.osReleasePath);
   auto& configurations = keep<FileConfigurationService>(launch.configurationDirectory);
   auto& gate = keep<TaskingGate>(variant, configurations, queues, clock);
-  auto& cookie = keep<CookieFile>(keep<LocalFiles>());
   auto& spool = keep<Spool>(state.path(), clock);
-  auto& throttle = keep<Throttle>(clock);
-  const EventRoad road{keep<ProcessIdentity>(keep<AppBundles>()), throttle, spool, reportingQueue};
-  auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
-  return keep<ReportingRun>(
-      gate, cookie, RunSurroundings{status, queues, clock, keep<MountTable>(), variant},
-      [store = launch.traceStore, &status] {
-        // Not make_shared(), with which the weak reference of a past run's poll would hold the
-        // whole extractor's memory.
-        std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store));
-        extractor->reportProgressTo(status);
-        return extractor;
-      },
-      road, summary,
-      [&spool, &state, &reportingQueue](const RunRecord& record) {
-        reportingQueue.sync([&] { keepRecord(record, spool, state.path()); });
-      });
+  auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
+  return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
+                            [&spool, &state, &reportingQueue](const RunRecord& record) {
+                              // The spool belongs to this queue.
+                              reportingQueue.sync([&] { keepRecord(record, spool, state.path()); });
+                            });
 }
 
 [[noreturn]] void serve() {
@@ -110,6 +124,8 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   const auto processingQueue = std::make_shared<WorkerQueue>("tessel_reporter processing queue");
   auto& reportingQueue = keep<WorkerQueue>("tessel_reporter Statora reporting queue");
   const auto interruptSource = runtime.makeSignalSource(SIGINT, processingQueue);
+  // At once, in the middle of a run if need be: the marker that it leaves makes the next run bail
+  // out.
   interruptSource->setHandler([] { std::exit(0); });
 
   auto& activity =
@@ -121,6 +137,7 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   scheduler.registerActivity(kActivityName, [&activity](const std::shared_ptr<Activity>& changed) {
     activity.handleActivity(changed);
   });
+  // Last, so that a signal never meets a service that is half made.
   interruptSource->resume();
   runtime.runMainLoop();
 }

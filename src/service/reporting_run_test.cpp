@@ -8,7 +8,7 @@
 
 #include "objects/testing/TestObjects.h"
 #include "platform/testing/Fakes.h"
-#include "service/ReporterActivity.h"
+#include "service/ReportingRun.h"
 
 namespace tessel {
 namespace {
@@ -20,9 +20,9 @@ using testing::makeInterval;
 using ::testing::Pair;
 using testing::TestPoint;
 
-class ReportingRunTest : public ::testing::Test {
+class RunTest : public ::testing::Test {
  protected:
-  ReportingRunTest() { variant.internal = true; }
+  RunTest() { variant.internal = true; }
 
   std::shared_ptr<TesselSupportObjectExtractor> nextExtractor() {
     log.write(LogLevel::debug, "", "", "(extractor made)");
@@ -60,17 +60,24 @@ class ReportingRunTest : public ::testing::Test {
   Throttle throttle{clock};
   ProcessIdentity identity{bundles};
   RunSummary summary{sender, throttle, clock, dates, status};
-  const EventRoad road{identity, throttle, sender, reportingQueue};
-  ReportingRun run{gate,
-                   cookie,
-                   {status, queues, clock, volumes, variant},
-                   [this] { return nextExtractor(); },
-                   road,
-                   summary,
-                   [this](const RunRecord& record) { records.push_back(record); }};
+  EventRoad road{throttle, sender, reportingQueue};
+  DeferralPoll poll{queues};
+  TraceReading reading{[this] { return nextExtractor(); },
+                       [this] {
+                         return std::make_shared<ObjectReporter>(
+                             TesselReporterObjectFilter::init(variant), bootVolumeFacts(volumes),
+                             identity, road);
+                       },
+                       poll,
+                       summary,
+                       reportingQueue,
+                       clock,
+                       status};
+  ReportingRun run{gate,  cookie, reading,
+                   clock, status, [this](const RunRecord& record) { records.push_back(record); }};
 };
 
-TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
+TEST_F(RunTest, GoesThroughItsStepsInOrder) {
   extractor->duringProcessing = [this] { EXPECT_TRUE(files.items.contains(cookieFilePath)); };
   perform();
   EXPECT_THAT(linesBeforeSummary(),
@@ -89,7 +96,7 @@ TEST_F(ReportingRunTest, GoesThroughItsStepsInOrder) {
                                        "reading the trace store", "summarising", "idle"));
 }
 
-TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsAndOneWithoutANameAsOneBeforeTheSummary) {
+TEST_F(RunTest, AnObjectIsTwoEventsAndANamelessOneOne) {
   TestPoint point;
   TestPoint nameless;
   nameless.name.reset();
@@ -114,7 +121,7 @@ TEST_F(ReportingRunTest, EachObjectLeavesAsTwoEventsAndOneWithoutANameAsOneBefor
       R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
 }
 
-TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
+TEST_F(RunTest, WithoutTaskingNothingIsTouched) {
   variant.internal = false;
   files.items[cookieFilePath] = false;
   perform();
@@ -124,7 +131,7 @@ TEST_F(ReportingRunTest, WithoutTaskingNothingIsTouched) {
   EXPECT_EQ(records.at(0).outcome, RunOutcome::notTasked);
 }
 
-TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
+TEST_F(RunTest, AMarkerMakesOnlyOneRunBailOut) {
   files.items[cookieFilePath] = true;
   perform();
   EXPECT_THAT(log.lines(),
@@ -138,7 +145,7 @@ TEST_F(ReportingRunTest, AMarkerMakesOneRunBailOutAndTheNextReport) {
   EXPECT_EQ(records.at(1).outcome, RunOutcome::completed);
 }
 
-TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
+TEST_F(RunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
   files.canCreate = false;
   perform();
   EXPECT_EQ(log.lines().back(), "Could not create cookie file");
@@ -147,7 +154,7 @@ TEST_F(ReportingRunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
   EXPECT_EQ(records.at(0).failure, "the run marker could not be made");
 }
 
-TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
+TEST_F(RunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
   files.removal = RemovalResult{false, "Permission denied"};
   perform();
   files.items.clear();
@@ -157,7 +164,7 @@ TEST_F(ReportingRunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
                                         "Could not clear cookie file: Unknown error"));
 }
 
-TEST_F(ReportingRunTest, AMarkerThatIsGoneIsNotClearedAndOneThatIsThereIsNotMade) {
+TEST_F(RunTest, AMarkerIsClearedAndMadeOnlyIfNeeded) {
   files.removal = RemovalResult{false, "No such file or directory"};
   cookie.clearCookieFile();
   files.items[cookieFilePath] = false;
@@ -165,7 +172,7 @@ TEST_F(ReportingRunTest, AMarkerThatIsGoneIsNotClearedAndOneThatIsThereIsNotMade
   EXPECT_TRUE(log.lines().empty());
 }
 
-TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
+TEST_F(RunTest, AFailedExtractionHasASummary) {
   extractor->failure = PlatformError{ErrorCode::notFound, "/store: no such directory"};
   extractor->eventCount = 7;
   perform();
@@ -176,7 +183,7 @@ TEST_F(ReportingRunTest, AFailedExtractionStillGetsItsSummary) {
   EXPECT_EQ(records.at(0).failure, "/store: no such directory");
 }
 
-TEST_F(ReportingRunTest, AnUnknownFilesystemLeavesItsKeyOut) {
+TEST_F(RunTest, AnUnknownFilesystemLeavesItsKeyOut) {
   for (const auto& type : {std::optional<std::string>(), std::optional<std::string>("\xff")}) {
     volumes.type = type;
     extractor->objects = {makeEvent(TestPoint{})};
@@ -195,9 +202,9 @@ struct WithoutPayload final : TesselObject {
   std::optional<Payload> statoraPayload(ProcessIdentity& /*identity*/) const override { return {}; }
 };
 
-TEST_F(ReportingRunTest, AnObjectWhosePayloadCannotBeMadeIsSaidCountedAndNeitherPacedNorSent) {
+TEST_F(RunTest, AnObjectWithoutPayloadIsCountedAndNotSent) {
   const auto filter = TesselReporterObjectFilter::init(variant);
-  ObjectReporter reporter(road, filter, {}, SharedString("SSD"));
+  ObjectReporter reporter(filter, {{}, SharedString("SSD")}, identity, road);
   const SharedString text("Text");
   TracePointFields fields;
   fields.subsystem = fields.category = fields.name = text;
@@ -210,7 +217,7 @@ TEST_F(ReportingRunTest, AnObjectWhosePayloadCannotBeMadeIsSaidCountedAndNeither
   EXPECT_EQ(reportingQueue.pending(), 0u);
 }
 
-TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
+TEST_F(RunTest, ADeferralStopsTheExtraction) {
   extractor->objects = {makeEvent(TestPoint{}), makeEvent(TestPoint{})};
   activity->deferWanted = true;
   extractor->beforeProcessing = [this] {
@@ -231,7 +238,7 @@ TEST_F(ReportingRunTest, ADeferralStopsTheExtractionAndIsSaidInTheBooks) {
   EXPECT_EQ(timer->queue->label(), "tessel_reporter defer polling queue");
 }
 
-TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
+TEST_F(RunTest, ThePollOutlivesTheRunNotItsExtractor) {
   perform();
   const std::weak_ptr<testing::FakeExtractor> weak = extractor;
   extractor.reset();
@@ -249,7 +256,7 @@ TEST_F(ReportingRunTest, ThePollGoesOnAfterTheRunAndHoldsTheExtractorWeakly) {
   EXPECT_THAT(log.lines(), ElementsAre("Deferral not requested, continuing."));
 }
 
-TEST_F(ReportingRunTest, FivePairsOfEachSectionAreSentAndTheRestOnlyCounted) {
+TEST_F(RunTest, FivePairsOfEachSectionAreSent) {
   for (int pair = 0; pair < 7; ++pair) {
     TestPoint point;
     point.category = "C" + std::to_string(pair);
@@ -278,7 +285,7 @@ TEST_F(ReportingRunTest, FivePairsOfEachSectionAreSentAndTheRestOnlyCounted) {
   EXPECT_EQ(log.count("**************\nTotal tessel object count: 35"), 1u);
 }
 
-TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
+TEST_F(RunTest, TheBooksAreSentAndLogged) {
   TestPoint reported;
   TestPoint disabled;
   disabled.telemetryEnabled = false;
@@ -322,7 +329,7 @@ TEST_F(ReportingRunTest, TheBooksStandInTheStatisticsAndTheClosingLine) {
             1u);
 }
 
-TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
+TEST_F(RunTest, TheThrottleLineSumsUpTheProcess) {
   perform();
   for (const std::string& line : log.lines()) EXPECT_FALSE(line.starts_with("Throttled ")) << line;
   for (int i = 0; i < 5; ++i) extractor->objects.push_back(makeEvent(TestPoint{}));
@@ -336,7 +343,7 @@ TEST_F(ReportingRunTest, TheThrottleLineTellsOfAllSleepsOfTheProcess) {
   EXPECT_EQ(log.count(line), 2u);
 }
 
-class ReporterActivityTest : public ReportingRunTest {
+class ActivityTest : public RunTest {
  protected:
   void handle() { handler.handleActivity(activity); }
 
@@ -346,7 +353,7 @@ class ReporterActivityTest : public ReportingRunTest {
       "open com.vantor.tessel.tessel_reporter_activity transaction", "clean exit", "close"};
 };
 
-TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTransactionCloses) {
+TEST_F(ActivityTest, EachStateAsksForACleanExit) {
   for (const int64_t state : {0, 1, 3, -5}) {
     runtime.calls.clear();
     activity->currentState = state;
@@ -358,7 +365,7 @@ TEST_F(ReporterActivityTest, EveryStateEndsWithTheCleanExitRequestBeforeTheTrans
   EXPECT_TRUE(records.empty());
 }
 
-TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
+TEST_F(ActivityTest, ADeferredRunDoesNotAskTheGate) {
   activity->deferWanted = true;
   handle();
   EXPECT_THAT(log.lines(), ElementsAre("Deferred tessel_reporter\n"));
@@ -367,7 +374,7 @@ TEST_F(ReporterActivityTest, ARunThatShouldDeferIsDeferredAndTheGateNotAsked) {
   EXPECT_EQ(variant.asked, 0u);
 }
 
-TEST_F(ReporterActivityTest, ADeferralThatIsNotTakenRunsAllTheSame) {
+TEST_F(ActivityTest, ARefusedDeferralRuns) {
   activity->deferWanted = true;
   activity->takesStates = false;
   handle();

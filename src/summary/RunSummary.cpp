@@ -121,6 +121,7 @@ uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
   uint64_t sent = 0;
   for (const Section& section : kSections) {
     const TesselReporterAggregation& aggregation = (filter.*section.aggregation)();
+    // The heading stands even over an empty section, so that a log shows that nothing was counted.
     tesselReporterLog().debug(section.header, aggregation.totalCount());
     CountReporter counts(sender_, throttle_, section.classification);
     uint64_t counted = 0;
@@ -136,6 +137,7 @@ uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
 }
 
 float RunSummary::secondsSince(uint64_t startTime) {
+  // Continuous ticks, because a machine that sleeps during a run was still processing it.
   const uint64_t endTime = clock_.continuousTicks();
   const Timebase timebase = clock_.timebase();
   const double secondsPerTick =

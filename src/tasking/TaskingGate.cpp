@@ -1,4 +1,6 @@
 // The rules of tasking, their lines in the log, and the wait for the configuration.
+//
+// Every doubt means no: a machine that was not asked to report must not, whatever went wrong.
 
 #include "tasking/TaskingGate.h"
 
@@ -85,6 +87,7 @@ TaskingDecision decideTasking(BuildVariant& buildVariant,
 
 TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* configuration,
                                                 const std::string& type) {
+  // The service may deliver any configuration that somebody in this process observes.
   if (type != kTaskingType) return {TaskingReason::unexpectedType};
   if (configuration == nullptr) return {TaskingReason::nilConfiguration};
   const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
@@ -95,6 +98,7 @@ TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* config
 
 TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value) {
   if (value == nullptr) return {TaskingReason::noAnswer};
+  // A text is no answer, not even "true": we would have to guess what its author meant.
   const auto* number = std::get_if<Number>(&value->value);
   if (number == nullptr) return {TaskingReason::answerNotANumber};
   return {booleanValue(*number) ? TaskingReason::taskedOn : TaskingReason::taskedOff};
@@ -112,6 +116,7 @@ TaskingDecision TaskingGate::decide() {
 TaskingDecision TaskingGate::awaitTaskingConfiguration() {
   const auto queue = queues_.makeSerialQueue("tessel_reporter configuration observing queue");
   const auto answer = std::make_shared<SharedAnswer>();
+  // A new observer for each run: its first delivery is the configuration as it is now.
   const auto observer = configurations_.makeObserver();
   observer->setDelegate(std::make_shared<TesselReporterConfigObserverDelegate>(
                             [answer](const std::shared_ptr<const ConfigurationValue>& configuration,

@@ -43,7 +43,7 @@ class TaskingGateTest : public ::testing::Test {
   TaskingGate gate{variant, configurations, queues, clock};
 };
 
-TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
+TEST_F(TaskingGateTest, AnInternalBuildDoesNotAsk) {
   variant.internal = true;
   const TaskingDecision decision = gate.decide();
   EXPECT_TRUE(decision.on());
@@ -54,7 +54,7 @@ TEST_F(TaskingGateTest, AnInternalBuildReportsWithoutAsking) {
   EXPECT_TRUE(queues.queues.empty());
 }
 
-TEST_F(TaskingGateTest, ObservesOneTypeAndTimesOutAfterFiveSeconds) {
+TEST_F(TaskingGateTest, TimesOutAfterFiveSeconds) {
   EXPECT_EQ(gate.decide().source(), TaskingSource::absent);
   EXPECT_EQ(log.lines(), std::vector{notReporting("Timeout waiting for config")});
   EXPECT_EQ(clock.waits, std::vector<std::chrono::nanoseconds>{std::chrono::seconds{5}});
@@ -63,7 +63,7 @@ TEST_F(TaskingGateTest, ObservesOneTypeAndTimesOutAfterFiveSeconds) {
             "tessel_reporter configuration observing queue");
 }
 
-TEST_F(TaskingGateTest, EachConfigurationHasItsDecisionAndLine) {
+TEST_F(TaskingGateTest, EachDecisionHasItsLine) {
   const char* kOn = "Reporting based on being tasked-on by Statora";
   const std::string kOff = notReporting("'TaskedOn' is false");
   const std::string kNoDictionary = notReporting("Non-KVDictionary configuration object");
@@ -96,12 +96,12 @@ TEST_F(TaskingGateTest, EachConfigurationHasItsDecisionAndLine) {
   }
 }
 
-TEST_F(TaskingGateTest, TheLastOfSeveralConfigurationsDecides) {
+TEST_F(TaskingGateTest, TheLastConfigurationDecides) {
   EXPECT_TRUE(ask({{nullptr, kType}, {taskedOn({Number{true}}), kType}}).on());
   EXPECT_FALSE(ask({{taskedOn({Number{true}}), kType}, {taskedOn({Number{false}}), kType}}).on());
 }
 
-TEST_F(TaskingGateTest, ALateConfigurationIsLoggedAndChangesNothing) {
+TEST_F(TaskingGateTest, ALateConfigurationIsOnlyLogged) {
   EXPECT_FALSE(gate.shouldReport());
   log.clear();
   configurations.observers.at(0)->deliver(taskedOn({Number{true}}), kType);

@@ -1,4 +1,7 @@
 // The profiles of the platforms.
+//
+// The tables are constants, not objects with constructors, so a profile can be asked for at any
+// time, even while the process starts or ends.
 
 #include "whitelist/PlatformProfile.h"
 
@@ -18,6 +21,7 @@ constexpr StringListSource kSelvinLists[] = {
     launchSourceValues,         cameraValues,           shareActivityTypes,
     extensionBundleIdentifiers, periodViewValues,       sizeValues,
     mailAccountKindValues,      generationSourceValues, commonWhitelistValues};
+// Platforms without lists of their own know only what all know.
 constexpr StringListSource kCommonLists[] = {commonWhitelistValues};
 
 // A cap of 0 switches a trace point off; its ratio then only has to be one that makes an entry.
@@ -59,6 +63,7 @@ const PlatformProfile& profileOf(TesselReporterPlatform platform) {
 }
 
 TesselReporterPlatform platformFromName(StringRef name) {
+  // Five short names: a map would cost more than it saves.
   const auto* const found = std::ranges::find_if(
       kProfiles, [&](const PlatformProfile& profile) { return sameString(name, profile.name); });
   return found == kProfiles.end() ? Platform::unknown : found->platform;
@@ -66,6 +71,7 @@ TesselReporterPlatform platformFromName(StringRef name) {
 
 std::string platformNames() {
   std::string names;
+  // The first profile is that of the unknown platform, which nobody can ask for by name.
   for (const PlatformProfile& profile : platformProfiles().subspan<1>())
     names.append(names.empty() ? "" : ", ").append(profile.name);
   return names;

@@ -49,6 +49,8 @@ bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef n
 }
 
 bool perfLoggingOperationStringsPass(StringRef component, StringRef action) {
+  // Each in its own set, because a component's name is no action and says something else there.
+  // Presence first: it is cheap, and most such trace points would else build both sets for nothing.
   return component.present() && action.present() && perfLoggingComponentSet().contains(component) &&
          perfLoggingActionSet().contains(action);
 }

@@ -45,7 +45,7 @@ const struct {
     {"generation sources", generationSourceValues(), 4, 4, {Platform::selvin}},
 };
 
-TEST(StringWhitelistTest, EachPlatformKnowsItsListsWhichShareNothing) {
+TEST(WhitelistTest, EachPlatformKnowsItsLists) {
   std::map<Platform, size_t> sizes;
   std::set<std::string_view> seen;
   for (const auto& row : kLists) {
@@ -69,7 +69,7 @@ TEST(StringWhitelistTest, EachPlatformKnowsItsListsWhichShareNothing) {
   }
 }
 
-TEST(StringWhitelistTest, MembershipIsExact) {
+TEST(WhitelistTest, MembershipIsExact) {
   for (const char* value : {"Week", "week ", "wee", "", "1,1,0,0", "5,1,0,0", "2,1,0,2"}) {
     EXPECT_FALSE(isKnown(value, Platform::selvin)) << value;
   }
@@ -87,7 +87,7 @@ TEST(StringWhitelistTest, MembershipIsExact) {
   std::exit(0);
 }
 
-TEST(StringWhitelistDeathTest, ASetSaysItsSizeOnceAndLumetOnEveryLookup) {
+TEST(WhitelistDeathTest, ASetLogsItsSizeOnce) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_EXIT(printLinesOfTwoLookups(Platform::darrow), ::testing::ExitedWithCode(0),
               "^\\[Using string whitelist with 2 elements for Darrow platform\\]$");
@@ -99,7 +99,7 @@ TEST(StringWhitelistDeathTest, ASetSaysItsSizeOnceAndLumetOnEveryLookup) {
       "\\[Using string whitelist with 0 elements\\]\\[Using string whitelist with 0 elements\\]$");
 }
 
-TEST(StringWhitelistTest, TheBuildVariantSwitchesItOff) {
+TEST(WhitelistTest, TheBuildVariantSwitchesItOff) {
   testing::FakeBuildVariant variant;
   const testing::RecordingLog log;
   for (const bool internal : {true, false}) {
@@ -111,7 +111,7 @@ TEST(StringWhitelistTest, TheBuildVariantSwitchesItOff) {
   EXPECT_EQ(variant.lastSubsystem, "com.vantor.tessel");
 }
 
-TEST(StringWhitelistTest, APerfLoggingOperationIsKnownByAllThreeStrings) {
+TEST(WhitelistTest, AllThreeNamesMakePerfLogging) {
   const SharedString subsystem("com.vantor.PerformanceAnalysis");
   const SharedString category("PerfLogging");
   const SharedString name("PerfLoggingOperation");

@@ -11,7 +11,6 @@
 #include "journal/EntryStream.h"
 #include "linux/SystemFacts.h"
 #include "platform/Text.h"
-#include "service/BootVolume.h"
 #include "service/ObjectReporter.h"
 #include "tesselctl/commands/ReadingOptions.h"
 #include "tesselctl/judging/Tally.h"
@@ -64,9 +63,7 @@ class ObjectSelection {
 // Builds what would be sent, as the run does.
 class PayloadBuilder {
  public:
-  PayloadBuilder()
-      : identity_(bundles_),
-        bootVolume_{bootFilesystemType(volumes_), SharedString(bootDiskType)} {}
+  PayloadBuilder() : identity_(bundles_), bootVolume_(bootVolumeFacts(volumes_)) {}
 
   // Empty where nothing would be sent.
   std::string json(const TesselObject& object) {

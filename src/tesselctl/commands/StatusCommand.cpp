@@ -9,7 +9,7 @@
 
 #include "os/Files.h"
 #include "platform/Text.h"
-#include "service/CookieFile.h"
+#include "service/ReportingRun.h"
 #include "tesselctl/commands/Environment.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/reading/TimeArguments.h"
@@ -172,7 +172,7 @@ class Screen {
     }
     balance("Objects", run.objectsBalance(), sums);
     std::string rows = grouped(run.rowsStored) + " rows stored, expected 2 x " +
-                       grouped(run.classified[RunRecord::kReported]) +
+                       grouped(run.reported()) +
                        (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
                        " + " + grouped(run.countEvents) + " counts + 1";
     if (!run.rowsBalance()) rows += " = " + grouped(run.rowsExpected());

@@ -11,7 +11,7 @@
 #include "linux/StateDirectory.h"
 #include "linux/SystemFacts.h"
 #include "os/Files.h"
-#include "service/CookieFile.h"
+#include "service/ReportingRun.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel::ctl {

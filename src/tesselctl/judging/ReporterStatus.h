@@ -10,7 +10,7 @@
 #include <string>
 
 #include "linux/LaunchConfiguration.h"
-#include "platform/RunRecord.h"
+#include "objects/RunRecord.h"
 #include "tesselctl/judging/Tasking.h"
 #include "tesselctl/reading/SpoolReader.h"
 

@@ -7,7 +7,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/RunRecord.h"
+#include "objects/RunRecord.h"
 #include "tesselctl/judging/Tally.h"
 #include "trace/JournalExtractor.h"
 

@@ -17,6 +17,7 @@
 #include <utility>
 #include <vector>
 
+#include "objects/TesselReporterClassification.h"
 #include "platform/Losses.h"
 #include "platform/System.h"
 
@@ -39,16 +40,13 @@ constexpr std::string_view runOutcomeName(RunOutcome outcome) {
 }
 
 struct RunRecord {
-  static constexpr size_t kClassifications = 6;
-  static constexpr size_t kReported = 1;  // the classification code of what was reported
-
   Date start{};
   Date end{};
   RunOutcome outcome = RunOutcome::completed;
   std::string failure;     // why it failed, in words; empty where it did not
   uint64_t logEvents = 0;  // entries read, trace points or not
   uint64_t inspected = 0;  // trace objects
-  std::array<uint64_t, kClassifications> classified{};  // trace objects by classification code
+  ClassifiedCounts classified{};
   uint64_t unnamed = 0;      // reported objects without a name, which send one event instead of two
   uint64_t countEvents = 0;  // sent or tried
   // Absent where nothing was read, and in records of a service that kept it in another form.
@@ -63,13 +61,14 @@ struct RunRecord {
   bool hasBooks() const {
     return outcome == RunOutcome::completed || outcome == RunOutcome::interrupted;
   }
+  uint64_t reported() const { return classified[TesselReporterClassificationTelemetryReported]; }
   // Whether every inspected object has exactly one classification.
   bool objectsBalance() const {
     return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
   }
   // Rows that the run should have stored: two for each object reported, one where it has no name,
   // one for each count, one for the summary.
-  uint64_t rowsExpected() const { return 2 * classified[kReported] - unnamed + countEvents + 1; }
+  uint64_t rowsExpected() const { return 2 * reported() - unnamed + countEvents + 1; }
   bool rowsBalance() const { return rowsStored == rowsExpected(); }
 
   bool operator==(const RunRecord&) const = default;
