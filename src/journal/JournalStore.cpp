@@ -165,6 +165,7 @@ void JournalStore::State::openFile(StoreFile& file, uint32_t number) {
   FileReport& report = facts.files[number];
   if (!file.fd.valid()) {
     report.skipped = whyNotOpened(file.error);
+    report.refused = codeOf(file.error) == ErrorCode::noAccess;
     if (number == 0) firstFailure = codeOf(file.error);
     return;
   }

@@ -19,6 +19,7 @@ struct FileReport {
   uint64_t entriesRead = 0;            // of those in the range
   std::optional<std::string> skipped;  // why the file was not read; absent where it was
   bool outsideRange = false;           // that is why: it has nothing for the range, and all is well
+  bool refused = false;                // that is why: this user may not read it
   Losses problems;                     // damage; the places are of this file and have no name
 
   // `offset` is the byte where the damage was met.

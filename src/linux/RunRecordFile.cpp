@@ -6,11 +6,10 @@
 #include "linux/RunRecordFile.h"
 
 #include <algorithm>
-#include <fstream>
 #include <iterator>
 #include <nlohmann/json.hpp>
 
-#include "os/DurableFile.h"
+#include "os/Files.h"
 #include "platform/Invariant.h"
 #include "platform/Json.h"
 #include "platform/Text.h"
@@ -125,8 +124,8 @@ RunRecord recordFrom(const Json& json) {
 
 }  // namespace
 
-std::optional<std::string> writeRunRecord(const RunRecord& record,
-                                          const std::string& stateDirectory) {
+std::optional<PlatformError> writeRunRecord(const RunRecord& record,
+                                            const std::string& stateDirectory) {
   // A run that was not tasked read nothing and must not replace the record of one that did.
   TESSEL_INVARIANT(record.outcome != RunOutcome::notTasked);
   std::string text;
@@ -150,12 +149,10 @@ std::optional<std::string> writeRunRecord(const RunRecord& record,
 }
 
 std::optional<RunRecord> readRunRecord(const std::string& stateDirectory) {
-  std::ifstream file(recordPath(stateDirectory), std::ios::binary);
-  std::string text(kMaxRecordBytes, '\0');
-  file.read(text.data(), static_cast<std::streamsize>(text.size()));
-  text.resize(static_cast<size_t>(file.gcount()));
+  const auto text = readSmallFile(recordPath(stateDirectory), kMaxRecordBytes);
+  if (!text) return {};
   try {
-    return recordFrom(Json::parse(text));
+    return recordFrom(Json::parse(*text));
   } catch (const nlohmann::json::exception&) {
     // Half a record would show books that do not balance, so a damaged one is taken for none.
     return {};

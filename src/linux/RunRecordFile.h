@@ -8,14 +8,15 @@
 #include <string>
 
 #include "objects/RunRecord.h"
+#include "platform/Error.h"
 
 namespace tessel {
 
 // Replaces the record in the state directory. The file stays below 64 KiB whatever the store looked
-// like, because the list of losses is bounded and long texts lose their middle. The reason in words
-// where it cannot be written. REQUIRES: the run was tasked.
-std::optional<std::string> writeRunRecord(const RunRecord& record,
-                                          const std::string& stateDirectory);
+// like, because the list of losses is bounded and long texts lose their middle. Absent if that
+// succeeded. REQUIRES: the run was tasked.
+std::optional<PlatformError> writeRunRecord(const RunRecord& record,
+                                            const std::string& stateDirectory);
 
 // Nothing where there is no record or it cannot be understood. A record that an older service left
 // has no reading.

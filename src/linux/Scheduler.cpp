@@ -257,8 +257,8 @@ std::optional<Date> ActivityDeliveries::lastRun() const {
 
 void ActivityDeliveries::record(Date begin) {
   lastRunHere_ = begin;
-  if (const std::optional<std::string> error = state_.recordRun(begin)) {
-    tesselReporterLog().debug("Could not record the run: %@", *error);
+  if (const auto error = state_.recordRun(begin)) {
+    tesselReporterLog().debug("Could not record the run: %@", error->words);
   }
 }
 

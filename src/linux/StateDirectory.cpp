@@ -26,9 +26,7 @@
 #include <system_error>
 #include <tuple>
 
-#include "os/DurableFile.h"
 #include "os/Files.h"
-#include "os/UniqueFd.h"
 #include "platform/Text.h"
 
 namespace tessel {
@@ -57,24 +55,19 @@ int makeDirectory(const std::string& path) {
   return S_ISDIR(facts.st_mode) ? 0 : ENOTDIR;
 }
 
-// Opens the directory for flock(). A lock on the directory itself needs no file in it and no write
-// permission.
-UniqueFd openForLocking(const std::string& directory) {
-  return UniqueFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-}
-
 }  // namespace
 
 std::variant<StateDirectory, std::string> StateDirectory::open(const std::string& path) {
   const std::string plain = withoutTrailingSlashes(path);
   const std::string shown = "state directory " + plainText(plain, "\\x0a") + ": ";
   if (const int error = makeDirectory(plain)) return shown + errorWords(error);
-  if (!openForLocking(plain).valid()) return shown + errorWords(errno);
+  if (!openDirectory(plain).valid()) return shown + errorWords(errno);
   return StateDirectory(plain);
 }
 
 std::optional<RunLock> StateDirectory::lock(int operation) const {
-  UniqueFd directory = openForLocking(path_);
+  // The directory itself can be locked even where no file can be made in it.
+  UniqueFd directory = openDirectory(path_);
   if (!directory.valid()) return {};
   while (::flock(directory.get(), operation) != 0) {
     if (errno != EINTR) return {};
@@ -97,7 +90,7 @@ std::optional<Date> StateDirectory::lastRun() const {
   return Date(std::chrono::microseconds{microseconds});
 }
 
-std::optional<std::string> StateDirectory::recordRun(Date begin) const {
+std::optional<PlatformError> StateDirectory::recordRun(Date begin) const {
   return replaceFileDurably(recordFile(), std::to_string(begin.time_since_epoch().count()) + '\n');
 }
 
@@ -179,16 +172,13 @@ FileExistence LocalFiles::existence(const std::string& path) {
   return {true, S_ISDIR(facts.st_mode)};
 }
 
-// O_EXCL makes it one step with the question whether anything is there, and follows no link.
-bool LocalFiles::createFile(const std::string& path) {
-  constexpr int kNewFile = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
-  return UniqueFd(::open(path.c_str(), kNewFile, 0666)).valid();
-}
+// Asking first whether anything is there would leave a gap for another process. This is one step.
+bool LocalFiles::createFile(const std::string& path) { return createNewFile(path, 0666); }
 
 RemovalResult LocalFiles::remove(const std::string& path) {
   const std::filesystem::path whole(path);
   const std::string parentPath = whole.has_parent_path() ? whole.parent_path().string() : ".";
-  const UniqueFd parent(::open(parentPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const UniqueFd parent = openDirectory(parentPath);
   const std::optional<MountKey> mount = parent.valid() ? mountOf(parent.get()) : std::nullopt;
   if (!mount) return {false, parentPath + ": " + errorWords(errno)};
   Remover remover(*mount);

@@ -9,6 +9,7 @@
 #include <variant>
 
 #include "os/UniqueFd.h"
+#include "platform/Error.h"
 #include "platform/System.h"
 
 namespace tessel {
@@ -48,9 +49,9 @@ class StateDirectory {
 
   // When the last run began. Absent if there is no record or it cannot be understood.
   std::optional<Date> lastRun() const;
-  // Records a run. If that fails, answers the reason in words, and the earlier record still stands.
+  // Records a run. Absent if that succeeded; after an error the earlier record still stands.
   // REQUIRES: the caller holds the lock.
-  std::optional<std::string> recordRun(Date begin) const;
+  std::optional<PlatformError> recordRun(Date begin) const;
 
  private:
   explicit StateDirectory(std::string path) : path_(std::move(path)) {}

@@ -192,8 +192,8 @@ TEST_F(StateDirectoryTest, OneHolderOfTheLockAtATime) {
 
 TEST_F(StateDirectoryTest, TheRecordIsReplacedAsAWhole) {
   EXPECT_EQ(state_.lastRun(), std::nullopt);
-  EXPECT_EQ(state_.recordRun(kNoon - hours{24}), std::nullopt);
-  EXPECT_EQ(state_.recordRun(kNoon), std::nullopt);
+  EXPECT_FALSE(state_.recordRun(kNoon - hours{24}));
+  EXPECT_FALSE(state_.recordRun(kNoon));
   EXPECT_EQ(temporary_.read("deep/state/scheduler-last-run"), "1795000000000000\n");
   EXPECT_EQ(state_.lastRun(), kNoon);
   for (const char* record : {"", "\n", "17", "soon\n", "-5\n", "17 \n", "99999999999999999999\n"}) {
@@ -201,7 +201,8 @@ TEST_F(StateDirectoryTest, TheRecordIsReplacedAsAWhole) {
     EXPECT_EQ(state_.lastRun(), std::nullopt) << record;
   }
   std::filesystem::create_directory(state_.path() + "/scheduler-last-run.new");
-  EXPECT_EQ(state_.recordRun(kNoon), state_.path() + "/scheduler-last-run.new: Is a directory");
+  EXPECT_EQ(state_.recordRun(kNoon)->words,
+            state_.path() + "/scheduler-last-run.new: Is a directory");
 }
 
 // A scheduler's deliveries on the test's own thread, with a clock that jumps over every wait.

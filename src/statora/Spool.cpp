@@ -28,8 +28,7 @@
 #include <numeric>
 #include <utility>
 
-#include "os/DurableFile.h"
-#include "os/UniqueFd.h"
+#include "os/Files.h"
 #include "platform/Invariant.h"
 #include "platform/Log.h"
 #include "platform/Text.h"
@@ -72,9 +71,7 @@ SqliteStatus upgrade(SqliteDatabase& database) {
 //
 // Only a file that is not there yet is opened here. Closing any descriptor of a file drops all
 // locks that the process holds on it (POSIX), and so the locks of a database that is already open.
-void makeFile(const std::string& path) {
-  const UniqueFd made(::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0660));
-}
+void makeFile(const std::string& path) { createNewFile(path, 0660); }
 
 SqliteStatus prepareSchema(SqliteDatabase& database) {
   const auto version = database.integer("PRAGMA user_version");

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <memory>
 
-#include "tesselctl/commands/Commands.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -27,7 +27,8 @@ class NarrowFormatter final : public CLI::Formatter {
   static constexpr size_t kWidth = 80;
 };
 
-// Takes what stands behind "--" off the arguments.
+// Takes the words behind "--" off the arguments. They are another program's, and the parser would
+// read its options as ours.
 std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& arguments) {
   const auto dashes = std::find(arguments.begin(), arguments.end(), "--");
   if (dashes == arguments.end()) return std::nullopt;
@@ -51,12 +52,13 @@ int run(std::vector<std::string> arguments) {
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);
   addReportCommand(app, invocation);
+  // The parser would complain about a missing subcommand and not name the word that is wrong.
   if (!arguments.empty() && !arguments[0].starts_with('-') &&
       app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
           .empty()) {
     return fail(kUsage, "there is no command '" + arguments[0] + "'; see tesselctl --help");
   }
-  std::reverse(arguments.begin(), arguments.end());  // as the parser wants them
+  std::reverse(arguments.begin(), arguments.end());  // the parser takes words from the end
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& error) {

@@ -1,20 +1,18 @@
-// compare: what another setting would report that this one does not, and the other way round.
+// compare: what a second setting would report that the first does not, and the other way round.
+//
+// Over one period both settings judge the same objects, so we can say for each object what changes.
+// That needs one reading of the store. Over two periods the objects differ and cannot be matched.
+// There we compare trace points: which are reported in one period and not in the other.
 
-#include <unistd.h>
-
-#include <CLI/CLI.hpp>
 #include <algorithm>
 #include <map>
-#include <memory>
 #include <tuple>
 
-#include "linux/SystemFacts.h"
 #include "platform/Text.h"
-#include "tesselctl/commands/ReadingOptions.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/Tally.h"
 #include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/SummaryOutput.h"
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -32,7 +30,8 @@ struct Setting {
   Period period;
 };
 
-// Reads "Quarro,internal,last=24h"; a word that makes no sense is said and answered with nothing.
+// Reads "Quarro,internal,last=24h". What a setting does not name is as in `usual`. Absent where a
+// word makes no sense; a line on stderr names it by then.
 std::optional<Setting> settingOf(const std::string& words, const Reading& usual, Date now) {
   Setting setting{usual.machine, usual.period};
   PeriodArguments period;
@@ -67,21 +66,23 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
   return setting;
 }
 
-// Trace points that one side reports and the other does not, for one reason.
+// Trace points that one side reports and the other holds back for one reason.
 struct Change {
   bool starts = false;  // reported by the second side alone
   std::string subsystem;
   std::string category;
   std::string name;
-  std::string why;  // the other side's verdict; "not_recorded" where it has none
+  std::string why;  // verdict of the side that holds back; "not_recorded" if it met none
+  // The text that the whitelist held back: its slot, 1 or 2, and its value. 0 for another reason.
   uint8_t slot = 0;
-  std::string value;  // that the whitelist of the other side does not know
+  std::string value;
 
   // NOLINTNEXTLINE(modernize-use-nullptr): the 0 is the compiler's own
   auto operator<=>(const Change&) const = default;
 };
 
-// Grows with the distinct changes up to a limit; further ones are counted.
+// Counts of distinct changes. Values of the whitelist may be as many as the objects, so the list is
+// bounded as that of `explain --summary` is. Changes beyond the bound are counted together.
 class Changes {
  public:
   static constexpr size_t kMost = 8192;
@@ -99,6 +100,7 @@ class Changes {
   }
   std::vector<std::pair<Change, uint64_t>> listed() const {
     std::vector<std::pair<Change, uint64_t>> changes(counts_.begin(), counts_.end());
+    // Starts first, then most objects first. A stable sort keeps names in order among equals.
     std::stable_sort(changes.begin(), changes.end(), [](const auto& a, const auto& b) {
       return std::make_pair(!a.first.starts, b.second) < std::make_pair(!b.first.starts, a.second);
     });
@@ -131,7 +133,7 @@ void addReading(const DryRun& run, Comparison& comparison) {
   comparison.losses.add(comparison.store.reading.losses);
 }
 
-// Both judge each object of one period.
+// One period, two judges.
 void compareJudges(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
   Judge judges[2] = {Judge(settings[0].machine), Judge(settings[1].machine)};
   DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
@@ -140,6 +142,7 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
       ++comparison.sides[side][decisions[side].classification];
     if (decisions[0].shouldReport() == decisions[1].shouldReport()) return true;
     const bool starts = decisions[1].shouldReport();
+    // The reason is told by the side that holds the object back: the other one has none.
     const FilterDecision& held = decisions[starts ? 0 : 1];
     comparison.changes.add(
         {starts, textOf(object.subsystem()), textOf(object.category()), textOf(object.name()),
@@ -147,21 +150,21 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
         1);
     return true;
   });
-  ProgressBar bar(true);
-  comparison.error = run.read(settings[0].period,
-                              [&](double part, uint64_t entries) { bar.update(part, entries); });
+  comparison.error = readWithProgress(run, settings[0].period);
   addReading(run, comparison);
 }
 
-// Trace points of one kind in each of two periods.
+// What became of one trace point in each of two periods.
 struct PathFigures {
   VerdictCounts sides[2] = {};
 };
 using Path = std::tuple<std::string, std::string, std::string>;
 
+// A program that puts numbers into its names makes new paths without end. Objects of paths beyond
+// this bound count in the sums of their side, but no change is found for them.
 constexpr size_t kMaxPaths = 65536;
 
-// The verdict that held back most; the empty name where nothing was recorded.
+// The verdict that held back most objects.
 std::string mainReason(const VerdictCounts& counts) {
   if (sumOf(counts) == 0) return "not_recorded";
   auto main = kVerdictOrder[1];
@@ -172,7 +175,7 @@ std::string mainReason(const VerdictCounts& counts) {
   return std::string(verdictName(main));
 }
 
-// Objects of two periods are different ones: what is compared is which trace points are reported.
+// Two periods, each with a judge of its own. A run of the service begins with fresh counters too.
 void comparePeriods(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
   std::map<Path, PathFigures> paths;
   for (size_t side = 0; side < 2 && !comparison.error; ++side) {
@@ -189,15 +192,15 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
       }
       return true;
     });
-    ProgressBar bar(true);
-    comparison.error = run.read(settings[side].period, [&](double part, uint64_t entries) {
-      bar.update((part + static_cast<double>(side)) / 2, entries);
-    });
+    // Each period is half of the work on the progress bar.
+    const double half = static_cast<double>(side) / 2;
+    comparison.error = readWithProgress(run, settings[side].period, true, half, half + 0.5);
     addReading(run, comparison);
   }
   for (const auto& [path, figures] : paths) {
     const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];
     const uint64_t after = figures.sides[1][TesselReporterClassificationTelemetryReported];
+    // More or fewer of them is no change of the setting: traffic differs from day to day.
     if ((before == 0) == (after == 0)) continue;
     const bool starts = before == 0;
     comparison.changes.add({starts, std::get<0>(path), std::get<1>(path), std::get<2>(path),
@@ -228,8 +231,8 @@ std::string comparisonJson(const Comparison& comparison) {
   });
 }
 
-std::string comparisonText(const Comparison& comparison, const CompareOptions& options) {
-  const Terminal terminal = terminalBehind(STDOUT_FILENO);
+std::string comparisonText(const Comparison& comparison, const CompareOptions& options,
+                           const Terminal& terminal) {
   Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
   for (const auto verdict : kVerdictOrder) {
     sums.add({std::string(verdictName(verdict)), grouped(comparison.sides[0][verdict]),
@@ -262,50 +265,45 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
   return out;
 }
 
-int runCompare(const CompareOptions& options) {
-  const auto launch = launchConfiguration();
-  if (!launch) return kUsage;
-  const Date now = SystemClock().now();
-  const auto reading = readingOf(options.reading, *launch, now);
+int runCompare(const CompareOptions& options, const Surroundings& surroundings) {
+  const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
-  const auto a = settingOf(options.settings[0], *reading, now);
-  const auto b = a ? settingOf(options.settings[1], *reading, now) : std::nullopt;
+  const auto a = settingOf(options.settings[0], *reading, surroundings.now);
+  const auto b = a ? settingOf(options.settings[1], *reading, surroundings.now) : std::nullopt;
   if (!b) return kUsage;
   const Setting settings[2] = {*a, *b};
   const bool samePeriod = a->period.start == b->period.start && a->period.end == b->period.end;
   Comparison comparison;
   (samePeriod ? compareJudges : comparePeriods)(settings, *reading, comparison);
-  if (comparison.error) return failToRead(comparison.error->words, reading->store);
-  print(options.json ? comparisonJson(comparison) : comparisonText(comparison, options));
+  if (comparison.error) return failToRead(*comparison.error, reading->store);
+  print(options.json ? comparisonJson(comparison)
+                     : comparisonText(comparison, options, surroundings.terminal));
   std::fflush(stdout);
-  return warnOfUnreadFiles(comparison.store, reading->store, kDone);
+  return warnOfUnreadFiles(comparison.store, reading->store);
 }
+
+const CommandText kCompare{
+    "compare", "Say what would start and what would stop being reported",
+    "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
+    "no-internal, a platform (Quarro, Selvin, Darrow, Fennic, Lumet), since=DATE, until=DATE,\n"
+    "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
+    "trace\n"
+    "points are compared that are reported at all.\n\n"
+    "Examples:\n"
+    "  tesselctl compare usual internal\n"
+    "  tesselctl compare Selvin Quarro,internal --last 7d\n"
+    "  tesselctl compare since=yesterday,until=today since=today"};
 
 }  // namespace
 
 void addCompareCommand(CLI::App& app, Invocation& invocation) {
-  const auto options = std::make_shared<CompareOptions>();
-  CLI::App* command =
-      app.add_subcommand("compare", "Say what would start and what would stop being reported");
-  command->add_option("A", options->settings[0], "Setting to start from")
+  const auto [command, options] = addCommand(app, invocation, kCompare, runCompare);
+  command.add_option("A", options.settings[0], "Setting to start from")->required()->type_name("");
+  command.add_option("B", options.settings[1], "Setting to compare with it")
       ->required()
       ->type_name("");
-  command->add_option("B", options->settings[1], "Setting to compare with it")
-      ->required()
-      ->type_name("");
-  addPeriodOptions(*command, options->reading);
-  command->add_flag("--json", options->json, "One JSON object: a, b, starts, stops, changes");
-  command->footer(
-      "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
-      "no-internal, a platform (Quarro, Selvin, Darrow, Fennic, Lumet), since=DATE, until=DATE,\n"
-      "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
-      "trace\n"
-      "points are compared that are reported at all.\n\n"
-      "Examples:\n"
-      "  tesselctl compare usual internal\n"
-      "  tesselctl compare Selvin Quarro,internal --last 7d\n"
-      "  tesselctl compare since=yesterday,until=today since=today");
-  command->callback([&invocation, options] { invocation.status = runCompare(*options); });
+  addPeriodOptions(command, options.reading);
+  command.add_flag("--json", options.json, "One JSON object: a, b, starts, stops, changes");
 }
 
 }  // namespace tessel::ctl

@@ -1,21 +1,16 @@
 // events: what the spool holds, newest last.
+//
+// We read the database beside the service and never write to it. Rows are printed as they are read,
+// so a spool of many megabytes needs no more memory than one row, or than those that -n asks for.
 
-#include <fnmatch.h>
-#include <unistd.h>
-
-#include <CLI/CLI.hpp>
 #include <chrono>
 #include <deque>
-#include <memory>
 #include <nlohmann/json.hpp>
 #include <thread>
 
-#include "linux/SystemFacts.h"
 #include "platform/Text.h"
-#include "tesselctl/commands/Environment.h"
-#include "tesselctl/commands/ReadingOptions.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/reading/SpoolReader.h"
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -33,22 +28,16 @@ struct EventsOptions {
   bool json = false;
 };
 
+// SQLite does not tell other processes of a new row, so --follow must look. Five looks a second
+// seem immediate to people and cost one short query each.
 constexpr std::chrono::milliseconds kLookForRowsEvery{200};
 
-// What a payload says about itself.
+// A value that says "discarded" where the payload is no JSON. No exception leaves it.
 Json parsed(std::string_view payload) { return Json::parse(payload, nullptr, false); }
 
 std::string member(const Json& payload, const char* key) {
   const auto found = payload.is_object() ? payload.find(key) : payload.end();
   return found != payload.end() && found->is_string() ? found->get<std::string>() : "";
-}
-
-bool matches(const std::vector<std::string>& patterns, const std::string& text) {
-  if (patterns.empty()) return true;
-  for (const std::string& pattern : patterns) {
-    if (::fnmatch(pattern.c_str(), text.c_str(), 0) == 0) return true;
-  }
-  return false;
 }
 
 class RowSelection {
@@ -59,11 +48,12 @@ class RowSelection {
   bool wants(const SpoolRow& row) const {
     const Date date{std::chrono::microseconds{row.time}};
     if (period_ && (date < period_->start || date >= period_->end)) return false;
-    if (!matches(options_.names, std::string(row.name))) return false;
+    if (!fitsOne(options_.names, std::string(row.name))) return false;
+    // Parsing costs more than all the rest, so it comes last and only where it is needed.
     if (options_.subsystems.empty() && options_.categories.empty()) return true;
     const Json payload = parsed(row.payload);
-    return matches(options_.subsystems, member(payload, "Subsystem")) &&
-           matches(options_.categories, member(payload, "Category"));
+    return fitsOne(options_.subsystems, member(payload, "Subsystem")) &&
+           fitsOne(options_.categories, member(payload, "Category"));
   }
 
  private:
@@ -74,6 +64,8 @@ class RowSelection {
 std::string rowJson(const SpoolRow& row) {
   return objectLine([&](JsonWriter& json) {
     json.member("id", row.id).member("time", row.time).member("name", row.name);
+    // Anybody who may write to the spool may have written this row. A payload that is no JSON must
+    // not break the line that stands around it.
     if (Json::accept(row.payload))
       json.rawMember("payload", replaceInvalidUtf8(row.payload));
     else
@@ -81,7 +73,7 @@ std::string rowJson(const SpoolRow& row) {
   });
 }
 
-// The payload's values beside their keys, for a glance; the rest of it is for --json.
+// The payload as one line "path key=value ...". A glance is enough here; --json shows all of it.
 std::string glance(const Json& payload, std::string_view text) {
   if (!payload.is_object()) return terminalText(text);
   std::string path;
@@ -100,7 +92,7 @@ std::string glance(const Json& payload, std::string_view text) {
   return out;
 }
 
-// Names that begin alike differ at their ends, and the payload tells a per-name event's path.
+// All events of the service share one prefix. Without it the ends, which differ, fit the column.
 std::string shownName(std::string_view name) {
   constexpr std::string_view kCommon = "com.vantor.performance.";
   if (name.starts_with(kCommon)) return "~" + terminalText(name.substr(kCommon.size()));
@@ -121,11 +113,12 @@ std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
 
 class EventsRun {
  public:
-  EventsRun(const EventsOptions& options, std::optional<Period> period, SpoolReader& spool)
+  EventsRun(const EventsOptions& options, std::optional<Period> period,
+            const Surroundings& surroundings)
       : options_(options),
         selection_(options, period),
-        spool_(spool),
-        terminal_(terminalBehind(STDOUT_FILENO)) {}
+        spool_(surroundings.launch.stateDirectory),
+        terminal_(surroundings.terminal) {}
 
   int list() {
     const SpoolReader::State state = spool_.open();
@@ -157,7 +150,8 @@ class EventsRun {
     }
   }
 
-  // The rows that are new; with --newest, the last of them.
+  // Prints the rows that are new; false where the spool cannot be read. --newest holds for the
+  // first look only: what comes later under --follow is all new.
   bool show() {
     std::deque<std::string> last;
     const bool limited = options_.newest != 0;
@@ -183,64 +177,57 @@ class EventsRun {
       std::this_thread::sleep_for(kLookForRowsEvery);
       const SpoolReader::State state = spool_.open();
       if (state == SpoolReader::State::noAccess) return complain(state);
-      // A damaged spool is about to be set aside, an absent one to be made.
+      // The service sets a damaged spool aside and makes an absent one, so both pass.
       if (state == SpoolReader::State::open) show();
     }
   }
 
   const EventsOptions& options_;
   const RowSelection selection_;
-  SpoolReader& spool_;
-  const Terminal terminal_;
+  SpoolReader spool_;
+  const Terminal& terminal_;
   bool followed_ = false;
 };
 
-int runEvents(const EventsOptions& options) {
-  const auto launch = launchConfiguration();
-  if (!launch) return kUsage;
+int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
   std::optional<Period> period;
   if (options.period.given()) {
-    const PeriodResult result = periodOf(options.period, SystemClock().now());
+    const PeriodResult result = periodOf(options.period, surroundings.now);
     if (!result.period) return fail(kUsage, result.error);
     period = result.period;
-    // What is sent from now on is not in a period that ends now.
+    // A period ends now where nothing else is said. What --follow waits for comes later.
     if (options.follow && options.period.until.empty()) period->end = Date::max();
   }
-  SpoolReader spool(launch->stateDirectory);
-  return EventsRun(options, period, spool).list();
+  return EventsRun(options, period, surroundings).list();
 }
 
-constexpr char kEventsFooter[] =
+const CommandText kEvents{
+    "events", "Show what the spool holds, newest last",
     "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event sent, "
     "in\n"
     "order. '~' stands for 'com.vantor.performance.'. Patterns may hold * and ?.\n\n"
     "Examples:\n"
     "  tesselctl events -n 20\n"
     "  tesselctl events --name com.vantor.performance.tessel_reporting_stats --json\n"
-    "  tesselctl events --follow --subsystem com.vantor.Calendar";
+    "  tesselctl events --follow --subsystem com.vantor.Calendar"};
 
 }  // namespace
 
 void addEventsCommand(CLI::App& app, Invocation& invocation) {
-  const auto options = std::make_shared<EventsOptions>();
-  CLI::App* command = app.add_subcommand("events", "Show what the spool holds, newest last");
-  command->add_option("--since", options->period.since,
-                      "Only events sent since then; see 'tesselctl explain --help'");
-  command->add_option("--until", options->period.until, "Only events sent before then");
-  command->add_option("--last", options->period.last,
-                      "Only events of this length of time: 30m, 24h, 7d");
-  const auto filter = [&](const char* name, std::vector<std::string>& values, const char* help) {
-    command->add_option(name, values, help)->allow_extra_args(false)->type_name("PATTERN");
-  };
-  filter("--name", options->names, "Only events of this name; may be repeated");
-  filter("--subsystem", options->subsystems, "Only payloads of this subsystem; may be repeated");
-  filter("--category", options->categories, "Only payloads of this category; may be repeated");
-  command->add_option("-n,--newest", options->newest, "Only so many, the newest")
-      ->type_name("COUNT");
-  command->add_flag("--follow", options->follow, "Go on with what is sent from now on");
-  command->add_flag("--json", options->json, "One JSON object a line: id, time, name, payload");
-  command->footer(kEventsFooter);
-  command->callback([&invocation, options] { invocation.status = runEvents(*options); });
+  const auto [command, options] = addCommand(app, invocation, kEvents, runEvents);
+  command.add_option("--since", options.period.since,
+                     "Only events sent since then; see 'tesselctl explain --help'");
+  command.add_option("--until", options.period.until, "Only events sent before then");
+  command.add_option("--last", options.period.last,
+                     "Only events of this length of time: 30m, 24h, 7d");
+  addPatterns(command, "--name", options.names, "Only events of this name; may be repeated");
+  addPatterns(command, "--subsystem", options.subsystems,
+              "Only payloads of this subsystem; may be repeated");
+  addPatterns(command, "--category", options.categories,
+              "Only payloads of this category; may be repeated");
+  command.add_option("-n,--newest", options.newest, "Only so many, the newest")->type_name("COUNT");
+  command.add_flag("--follow", options.follow, "Go on with what is sent from now on");
+  command.add_flag("--json", options.json, "One JSON object a line: id, time, name, payload");
 }
 
 }  // namespace tessel::ctl

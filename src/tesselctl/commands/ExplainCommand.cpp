@@ -1,21 +1,19 @@
 // explain: what becomes of each recorded trace point, and why.
+//
+// The service's own filter judges here, so the answer cannot differ from that of a run. Every
+// object is judged before the options choose what is shown: the downsampling counters must see all
+// of them.
 
-#include <fnmatch.h>
-#include <unistd.h>
-
-#include <CLI/CLI.hpp>
 #include <algorithm>
 #include <memory>
-#include <vector>
 
 #include "journal/EntryStream.h"
 #include "linux/SystemFacts.h"
 #include "platform/Text.h"
 #include "service/ObjectReporter.h"
-#include "tesselctl/commands/ReadingOptions.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/Tally.h"
 #include "tesselctl/showing/SummaryOutput.h"
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -33,34 +31,19 @@ struct ExplainOptions {
   bool json = false;
 };
 
-// Which trace objects are shown.
-class ObjectSelection {
- public:
-  explicit ObjectSelection(const ExplainOptions& options) : options_(options) {}
+// Whether the options choose an object. A million objects may pass here, so a text is copied for
+// the pattern matcher only where there is a pattern.
+bool chosen(const ExplainOptions& options, const TesselObject& object,
+            TesselReporterClassification verdict) {
+  const auto fits = [](const std::vector<std::string>& patterns, StringRef text) {
+    return patterns.empty() || fitsOne(patterns, std::string(text.textOr("")));
+  };
+  return fits(options.subsystems, object.subsystem()) &&
+         fits(options.categories, object.category()) && fits(options.names, object.name()) &&
+         fitsOne(options.verdicts, std::string(verdictName(verdict)));
+}
 
-  bool wants(const TesselObject& object, TesselReporterClassification verdict) const {
-    return matches(options_.subsystems, object.subsystem()) &&
-           matches(options_.categories, object.category()) &&
-           matches(options_.names, object.name()) &&
-           isOneOf(options_.verdicts, verdictName(verdict));
-  }
-
- private:
-  static bool isOneOf(const std::vector<std::string>& wanted, std::string_view name) {
-    return wanted.empty() || std::find(wanted.begin(), wanted.end(), name) != wanted.end();
-  }
-  static bool matches(const std::vector<std::string>& patterns, StringRef text) {
-    if (patterns.empty()) return true;
-    const std::string value(text.textOr(""));
-    return std::any_of(patterns.begin(), patterns.end(), [&](const std::string& pattern) {
-      return ::fnmatch(pattern.c_str(), value.c_str(), 0) == 0;
-    });
-  }
-
-  const ExplainOptions& options_;
-};
-
-// Builds what would be sent, as the run does.
+// Builds the payload with the code and the facts of a run, identities of processes included.
 class PayloadBuilder {
  public:
   PayloadBuilder() : identity_(bundles_), bootVolume_(bootVolumeFacts(volumes_)) {}
@@ -83,8 +66,8 @@ struct Explanation {
   const TesselObject& object;
   const EntryHeader& entry;
   const FilterDecision& decision;
-  std::string scope;    // of the downsampling entry that was asked
-  std::string payload;  // JSON; empty where there is none or none is wanted
+  std::string scope;    // part of the downsampling table that was asked; empty: none was
+  std::string payload;  // JSON; empty where nothing would be sent or --payload is not given
 };
 
 std::string explanationJson(const Explanation& explanation) {
@@ -102,7 +85,8 @@ std::string explanationJson(const Explanation& explanation) {
   });
 }
 
-constexpr size_t kNameWidth = 60;     // columns of a subsystem, category or name
+// Columns. A name may be 4,096 bytes long, and one object must not fill the screen.
+constexpr size_t kNameWidth = 60;
 constexpr size_t kVerdictWidth = 18;  // of the longest verdict
 constexpr size_t kKindWidth = 9;
 constexpr size_t kFooterWidth = 94;  // as wide as the help text around it
@@ -125,6 +109,7 @@ std::string shownKind(const TesselObject& object) {
                                                          : "event";
 }
 
+// The columns of one object: one line, more where its path is long, and one for the reason.
 class HumanLines {
  public:
   HumanLines(const Terminal& terminal, const Period& period)
@@ -150,6 +135,7 @@ class HumanLines {
     if (const std::string why = ruleWords(decision, explanation.scope); !why.empty()) {
       out += std::string(timeWidth(), ' ') + indented(why, timeWidth());
     }
+    // The payload is not wrapped, so that it can be copied.
     if (!explanation.payload.empty())
       out += std::string(timeWidth(), ' ') + explanation.payload + "\n";
     return out;
@@ -158,13 +144,7 @@ class HumanLines {
  private:
   size_t timeWidth() const { return withDay_ ? 16 : 10; }
   std::string indented(const std::string& text, size_t indent) const {
-    const size_t room = std::max(terminal_.width, indent + 12) - indent;
-    std::string out = wrapped(text, room, 0);
-    for (size_t at = out.find('\n'); at != std::string::npos;
-         at = out.find('\n', at + indent + 1)) {
-      out.insert(at + 1, indent, ' ');
-    }
-    return out + "\n";
+    return wrappedBeside(text, terminal_.width, indent) + "\n";
   }
 
   const Terminal terminal_;
@@ -173,13 +153,14 @@ class HumanLines {
 
 class ExplainRun {
  public:
-  ExplainRun(const ExplainOptions& options, const Reading& reading)
+  ExplainRun(const ExplainOptions& options, const Reading& reading,
+             const Surroundings& surroundings)
       : options_(options),
         reading_(reading),
-        selection_(options),
         judge_(reading.machine),
         tally_(reading.period),
-        terminal_(terminalBehind(STDOUT_FILENO)),
+        terminal_(surroundings.terminal),
+        now_(surroundings.now),
         lines_(terminal_, reading.period),
         run_(reading.store, [this](const TesselObject& object, const EntryHeader& entry) {
           inspect(object, entry);
@@ -193,7 +174,7 @@ class ExplainRun {
  private:
   void inspect(const TesselObject& object, const EntryHeader& entry) {
     const FilterDecision decision = judge_.inspect(object);
-    if (!selection_.wants(object, decision.classification)) return;
+    if (!chosen(options_, object, decision.classification)) return;
     tally_.count(object, decision, entry);
     if (options_.summary) return;
     const Explanation explanation{
@@ -204,16 +185,15 @@ class ExplainRun {
   }
 
   int follow() {
-    const auto error = run_.follow(SystemClock().now(), [] { std::fflush(stdout); });
-    return error ? failToRead(error->words, reading_.store) : kDone;
+    const auto error = run_.follow(now_, [] { std::fflush(stdout); });
+    return error ? failToRead(*error, reading_.store) : kDone;
   }
 
   int readOnce() {
-    ProgressBar bar(options_.summary || !terminal_.interactive);
-    const auto error = run_.read(reading_.period,
-                                 [&](double part, uint64_t entries) { bar.update(part, entries); });
-    bar.clear();
-    if (error) return failToRead(error->words, reading_.store);
+    // On a terminal the lines themselves show that the reading goes on.
+    const auto error =
+        readWithProgress(run_, reading_.period, options_.summary || !terminal_.interactive);
+    if (error) return failToRead(*error, reading_.store);
     if (options_.summary) {
       print(options_.json ? summaryJson(tally_, run_.report())
                           : summaryText(tally_, run_.report(), terminal_));
@@ -221,7 +201,7 @@ class ExplainRun {
       print(closingLine());
     }
     std::fflush(stdout);
-    return warnOfUnreadFiles(run_.report().store, reading_.store, kDone);
+    return warnOfUnreadFiles(run_.report().store, reading_.store);
   }
 
   std::string closingLine() const {
@@ -242,77 +222,68 @@ class ExplainRun {
 
   const ExplainOptions& options_;
   const Reading& reading_;
-  const ObjectSelection selection_;
   Judge judge_;
   Tally tally_;
-  const Terminal terminal_;
+  const Terminal& terminal_;
+  const Date now_;
   const HumanLines lines_;
   std::unique_ptr<PayloadBuilder> payloads_;
   DryRun run_;
 };
 
-int runExplain(const ExplainOptions& options) {
-  const auto launch = launchConfiguration();
-  if (!launch) return kUsage;
-  const auto reading = readingOf(options.reading, *launch, SystemClock().now());
+int runExplain(const ExplainOptions& options, const Surroundings& surroundings) {
+  const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   if (options.follow && (options.summary || options.reading.period.given())) {
     return fail(
         kUsage,
         "--follow shows what is recorded from now on; it goes with neither --summary nor a period");
   }
-  return ExplainRun(options, *reading).explain();
+  return ExplainRun(options, *reading, surroundings).explain();
 }
 
-std::string explainFooter() {
+constexpr char kNotes[] =
+    "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at zero, "
+    "as\n"
+    "in a service that has just started. Without a period the last 24 hours are read, as in a "
+    "run.\n"
+    "Patterns may hold * and ?. Members of the group systemd-journal may read the journal.\n\n";
+constexpr char kExamples[] =
+    "\n\nExamples:\n"
+    "  tesselctl explain --last 1h --subsystem 'com.vantor.*' --verdict string_whitelist\n"
+    "  tesselctl explain --follow\n"
+    "  tesselctl explain --summary";
+
+CommandText explainText() {
   std::string verdicts;
-  for (const ClassificationRow& row : kClassifications)
-    verdicts += (verdicts.empty() ? "Verdicts: " : ", ") + std::string(row.name);
-  return "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at "
-         "zero, "
-         "as\n"
-         "in a service that has just started. Without a period the last 24 hours are read, as in a "
-         "run.\n"
-         "Patterns may hold * and ?. Members of the group systemd-journal may read the "
-         "journal.\n\n" +
-         wrapped(verdicts + ".", kFooterWidth, 0) +
-         "\n\n"
-         "Examples:\n"
-         "  tesselctl explain --last 1h --subsystem 'com.vantor.*' --verdict string_whitelist\n"
-         "  tesselctl explain --follow\n"
-         "  tesselctl explain --summary";
+  for (const auto verdict : kVerdictOrder)
+    verdicts += (verdicts.empty() ? "Verdicts: " : ", ") + std::string(verdictName(verdict));
+  return {"explain", "Say what becomes of each recorded trace point, and why",
+          kNotes + wrapped(verdicts + ".", kFooterWidth, 0) + kExamples};
 }
 
-void addFilterOptions(CLI::App& command, ExplainOptions& options) {
-  const auto filter = [&](const char* name, std::vector<std::string>& values, const char* help) {
-    return command.add_option(name, values, help)->allow_extra_args(false)->type_name("PATTERN");
-  };
-  filter("--subsystem", options.subsystems, "Only trace points of this subsystem; may be repeated");
-  filter("--category", options.categories, "Only of this category; may be repeated");
-  filter("--name", options.names, "Only of this name; may be repeated");
-  filter("--verdict", options.verdicts, "Only with this verdict; may be repeated")
-      ->type_name("VERDICT")
-      ->check([](const std::string& name) {
-        const bool known = std::ranges::count(kClassifications, name, &ClassificationRow::name);
-        return known ? "" : "'" + terminalText(name) + "' is no verdict";
-      });
+std::string whyNoVerdict(const std::string& name) {
+  const bool known = std::ranges::count(kVerdictOrder, name, verdictName) != 0;
+  return known ? "" : "'" + terminalText(name) + "' is no verdict";
 }
 
 }  // namespace
 
 void addExplainCommand(CLI::App& app, Invocation& invocation) {
-  const auto options = std::make_shared<ExplainOptions>();
-  CLI::App* command =
-      app.add_subcommand("explain", "Say what becomes of each recorded trace point, and why");
-  addPeriodOptions(*command, options->reading);
-  addJudgeOptions(*command, options->reading);
-  addFilterOptions(*command, *options);
-  command->add_flag("--payload", options->payload, "Show the payload of what would be sent");
-  command->add_flag("--summary", options->summary, "Show figures instead of trace points");
-  command->add_flag("--follow", options->follow, "Go on with what is recorded from now on");
-  command->add_flag("--json", options->json, "One JSON object a line; with --summary one object");
-  command->footer(explainFooter());
-  command->callback([&invocation, options] { invocation.status = runExplain(*options); });
+  const auto [command, options] = addCommand(app, invocation, explainText(), runExplain);
+  addPeriodOptions(command, options.reading);
+  addJudgeOptions(command, options.reading);
+  addPatterns(command, "--subsystem", options.subsystems,
+              "Only trace points of this subsystem; may be repeated");
+  addPatterns(command, "--category", options.categories, "Only of this category; may be repeated");
+  addPatterns(command, "--name", options.names, "Only of this name; may be repeated");
+  addPatterns(command, "--verdict", options.verdicts, "Only with this verdict; may be repeated")
+      ->type_name("VERDICT")
+      ->check(whyNoVerdict);
+  command.add_flag("--payload", options.payload, "Show the payload of what would be sent");
+  command.add_flag("--summary", options.summary, "Show figures instead of trace points");
+  command.add_flag("--follow", options.follow, "Go on with what is recorded from now on");
+  command.add_flag("--json", options.json, "One JSON object a line; with --summary one object");
 }
 
 }  // namespace tessel::ctl

@@ -1,4 +1,7 @@
-// tesselctl record: writes trace points to the journal or to a store of its own.
+// record: writes trace points to the journal, or to an export file for trying things out.
+//
+// A point that a reader would count as malformed is refused here, with a reason. The journal itself
+// takes anything without a word, and the mistake would show a day later, as a number in the books.
 
 #include <spawn.h>
 #include <sys/wait.h>
@@ -6,11 +9,11 @@
 #include <cerrno>
 #include <csignal>
 #include <memory>
-#include <system_error>
 
 #include "journal/EntryRecording.h"
 #include "journal/EntryStream.h"
-#include "tesselctl/commands/Commands.h"
+#include "os/Files.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/commands/RecordedPoint.h"
 
 extern char** environ;
@@ -37,7 +40,8 @@ constexpr const char* kFooter =
     "the\n"
     "number of the signal that killed it, 127 where it is not found.";
 
-// What in --store mode stands in for what the journal daemon would have seen.
+// With --store there is no journal daemon that notes who wrote an entry and when. These options say
+// it in its place; without them it is this process, now.
 struct OriginOptions {
   std::optional<uint64_t> at, monotonic;
   std::optional<double> ago;
@@ -52,13 +56,14 @@ struct RecordOptions {
   std::optional<std::string> store;
 };
 
-// Thrown nowhere: an error and the status that goes with it.
+// An error and the exit status that goes with it. `record -- COMMAND` says it but exits otherwise.
 struct Failure {
   ExitStatus status;
   std::string message;
 };
 
-// Moves the monotonic time along with the time; nothing where that would be before the boot.
+// The monotonic time at `realtime`. Intervals are measured with it, so it must move along with the
+// time of day. Absent where `realtime` is before the boot.
 std::optional<uint64_t> movedMonotonic(const RecordOrigin& now, uint64_t realtime) {
   const auto distance = static_cast<int64_t>(realtime - now.realtime);
   if (distance < 0 && now.monotonic < static_cast<uint64_t>(-distance)) return std::nullopt;
@@ -76,7 +81,8 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
       return Failure{kUsage, "'" + *options.boot + "' is no boot id: 32 hexadecimal digits"};
     origin.boot = *boot;
   }
-  // A made-up boot counts its time from 1970, so that distances within it are right.
+  // Nobody knows when a made-up boot began. We let it begin in 1970: distances within it are right,
+  // and only distances matter.
   const std::optional<uint64_t> monotonic = options.monotonic ? options.monotonic
                                             : options.boot    ? std::optional(origin.realtime)
                                                            : movedMonotonic(now, origin.realtime);
@@ -87,6 +93,7 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
   if (options.imagePath) origin.imagePath = options.imagePath;
   if (options.processName) origin.processName = options.processName;
   if (options.process) origin.process = options.process;
+  // An empty value stands for a field that the daemon could not find out and left away.
   for (auto* text : {&origin.imagePath, &origin.processName, &origin.process}) {
     if (*text && (*text)->empty()) text->reset();
   }
@@ -110,15 +117,19 @@ std::optional<Failure> record(const RecordOptions& options, const std::string& k
     error = sendToJournal(list);
     if (error) error->words += " (--store DIR records without a journal)";
   }
+  // Whatever the reason, the store was not reached. Scripts need not tell more apart.
   if (error) return Failure{kNoAccess, error->words};
   return std::nullopt;
 }
 
+// As a shell says it: the status of the command, or 128 and the number of the signal.
 int exitStatusOf(int waitStatus) {
   return WIFEXITED(waitStatus) ? WEXITSTATUS(waitStatus) : 128 + WTERMSIG(waitStatus);
 }
 
-// Runs the command to its end; what the terminal sends to both of us is for the command.
+// Runs the command and answers its exit status. A key on the terminal sends its signal to both of
+// us. The command decides what it means: we ignore it, or the end of the interval would be missing.
+// The command itself must not inherit that, so it gets the defaults back.
 int runCommand(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
   arguments.reserve(command.size() + 1);
@@ -140,7 +151,8 @@ int runCommand(const std::vector<std::string>& command) {
       ::posix_spawnp(&child, arguments[0], nullptr, &attributes, arguments.data(), environ);
   posix_spawnattr_destroy(&attributes);
   if (error != 0) {
-    fail(kBad, command[0] + ": " + std::generic_category().message(error));
+    fail(kBad, fileError(command[0], error).words);
+    // The statuses that a shell uses: not found, and found but not to be run.
     return error == ENOENT ? 127 : 126;
   }
   int status = 0;
@@ -152,12 +164,14 @@ int runCommand(const std::vector<std::string>& command) {
 int recordAround(const RecordOptions& options, const std::vector<std::string>& command) {
   if (const auto failure = record(options, "begin")) return fail(failure->status, failure->message);
   const int status = runCommand(command);
-  // The command has done its work; that its end is not recorded does not change what it answered.
+  // Scripts want the status of the command, which has done its work, even if its end is not
+  // recorded.
   if (const auto failure = record(options, "end")) fail(failure->status, failure->message);
   return status;
 }
 
 int recordPoint(RecordOptions& options, const std::string& kind) {
+  // `record begin` and `record end` are two processes. In process scope they would never match.
   if (kind != "event" && !options.point.scope) options.point.scope = "system";
   const auto failure = record(options, kind);
   return failure ? fail(failure->status, failure->message) : kDone;

@@ -1,3 +1,6 @@
+// The rules for fields are those of the reader: its own limits and number parsers are used here, so
+// that the two cannot disagree.
+
 #include "tesselctl/commands/RecordedPoint.h"
 
 #include <algorithm>
@@ -10,7 +13,7 @@ namespace tessel::ctl {
 
 namespace {
 
-// Collects fields until the first that is no good.
+// Collects fields. It keeps the first complaint only: later ones often follow from it.
 class FieldList {
  public:
   void add(const std::string& name, const std::string& value) {
@@ -19,6 +22,7 @@ class FieldList {
                       " bytes long; the journal drops names over " +
                       std::to_string(kMaxFieldNameLength));
     }
+    // Other fields are for other readers, which have limits of their own.
     if (name.starts_with("TESSEL_") && value.size() > kMaxFieldValueLength) {
       return complain("the value of " + name + " is " + std::to_string(value.size()) +
                       " bytes long; the limit is " + std::to_string(kMaxFieldValueLength));
@@ -63,6 +67,7 @@ class FieldList {
   void addOther(const std::string& field) {
     const size_t equals = field.find('=');
     if (equals == std::string::npos) return complain("'" + field + "' is not NAME=VALUE");
+    // Names that begin with an underscore are the daemon's own: it drops those of clients.
     const std::string name = field.substr(0, equals);
     const auto valid = [](char c) {
       return (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_';

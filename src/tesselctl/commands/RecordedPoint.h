@@ -1,4 +1,6 @@
-// RecordedPoint: a trace point as it is asked for on the command line, and its journal fields.
+// RecordedPoint: a trace point from the command line, and the fields of its journal entry.
+//
+// A plain value; the function is stateless.
 
 #pragma once
 
@@ -29,8 +31,8 @@ struct RecordedPoint {
   std::string message = "tessel";
 };
 
-// The fields of the entry of kind `kind`, or what is wrong with the point, in words: whatever a
-// reader of the journal would count as malformed, and what the journal would drop without a word.
+// The fields of the entry of kind `kind` ("event", "begin" or "end"). A sentence instead, where a
+// reader would count the entry as malformed or the journal would drop a field without a word.
 std::variant<std::vector<RecordedField>, std::string> fieldsOf(const RecordedPoint& point,
                                                                const std::string& kind);
 

@@ -2,16 +2,12 @@
 
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
 #include <array>
-#include <memory>
 
 #include "linux/RunRecordFile.h"
-#include "linux/SystemFacts.h"
-#include "os/DurableFile.h"
-#include "tesselctl/commands/ReadingOptions.h"
+#include "os/Files.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/showing/HtmlReport.h"
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -34,66 +30,62 @@ int write(const std::string& path, const std::string& page) {
     print(page);
     return kDone;
   }
-  const auto reason = replaceFileDurably(path, page, kReadableByAll);
-  return reason ? failToWrite(*reason) : kDone;
+  // A web server may be reading the page of yesterday: it finds the old page or the new one.
+  const auto error = replaceFileDurably(path, page, kReadableByAll);
+  return error ? failToWrite(*error) : kDone;
 }
 
-int makeReport(const ReportOptions& options, const Reading& reading, ReportFacts facts) {
+int makeReport(const ReportOptions& options, const Reading& reading, const ReportFacts& facts) {
   Judge judge(reading.machine);
   Tally tally(reading.period);
   DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader& entry) {
     tally.count(object, judge.inspect(object), entry);
     return true;
   });
-  ProgressBar bar(true);
-  const auto error =
-      run.read(reading.period, [&](double part, uint64_t entries) { bar.update(part, entries); });
-  bar.clear();
-  if (error) return failToRead(error->words, reading.store);
-  facts.store = reading.store.value_or("the journal of this machine");
-  facts.platform = nameForPlatform(reading.machine.platform);
-  facts.internal = reading.machine.internal;
+  if (const auto error = readWithProgress(run, reading.period))
+    return failToRead(*error, reading.store);
   const int status = write(options.html, htmlReport(tally, run.report(), facts));
-  return status == kDone ? warnOfUnreadFiles(run.report().store, reading.store, kDone) : status;
+  return status == kDone ? warnOfUnreadFiles(run.report().store, reading.store) : status;
 }
 
-int runReport(const ReportOptions& options) {
-  const auto launch = launchConfiguration();
-  if (!launch) return kUsage;
-  ReportFacts facts;
-  facts.machine = machineName();
-  facts.made = SystemClock().now();
-  auto reading = readingOf(options.reading, *launch, facts.made);
+int runReport(const ReportOptions& options, const Surroundings& surroundings) {
+  auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
+  ReportFacts facts{machineName(),
+                    reading->store.value_or("the journal of this machine"),
+                    std::string(nameForPlatform(reading->machine.platform)),
+                    reading->machine.internal,
+                    surroundings.now,
+                    {}};
   if (options.lastRun) {
     if (options.reading.period.given()) return fail(kUsage, "--last-run has a period of its own");
-    facts.run = readRunRecord(launch->stateDirectory);
-    if (!facts.run) return fail(kBad, "no record of a run in " + launch->stateDirectory);
+    const std::string& directory = surroundings.launch.stateDirectory;
+    facts.run = readRunRecord(directory);
+    if (!facts.run) return fail(kBad, "no record of a run in " + directory);
     reading->period = {facts.run->start - std::chrono::hours{24}, facts.run->start};
   }
-  return makeReport(options, *reading, std::move(facts));
+  return makeReport(options, *reading, facts);
 }
+
+const CommandText kReport{
+    "report", "Make a page about what was recorded, reported and held back",
+    "One self-contained page without scripts. Its figures are those of 'tesselctl explain "
+    "--summary\n"
+    "--json' for the same period.\n\n"
+    "Example:\n"
+    "  tesselctl report --last 7d --html week.html"};
 
 }  // namespace
 
 void addReportCommand(CLI::App& app, Invocation& invocation) {
-  const auto options = std::make_shared<ReportOptions>();
-  CLI::App* command =
-      app.add_subcommand("report", "Make a page about what was recorded, reported and held back");
-  command->add_option("--html", options->html, "File to write, - for standard output")
+  const auto [command, options] = addCommand(app, invocation, kReport, runReport);
+  command.add_option("--html", options.html, "File to write, - for standard output")
       ->required()
       ->type_name("FILE");
-  command->add_flag("--last-run", options->lastRun,
-                    "The 24 hours that the last run looked back on, with its own books");
-  addPeriodOptions(*command, options->reading);
-  addJudgeOptions(*command, options->reading);
-  command->footer(
-      "One self-contained page without scripts. Its figures are those of 'tesselctl explain "
-      "--summary\n"
-      "--json' for the same period.\n\n"
-      "Example:\n"
-      "  tesselctl report --last 7d --html week.html");
-  command->callback([&invocation, options] { invocation.status = runReport(*options); });
+  command.add_flag("--last-run", options.lastRun,
+                   "The 24 hours that the last run looked back on, with its own books");
+  addPeriodOptions(command, options.reading);
+  addJudgeOptions(command, options.reading);
 }
 
 }  // namespace tessel::ctl

@@ -1,21 +1,20 @@
 // status: does this machine report, and do the books balance?
+//
+// The exit status is for scripts: it is bad only where the reporter itself failed. What the journal
+// lost, or that the machine is not tasked, is shown but is nobody's failure here.
 
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
 #include <cerrno>
-#include <memory>
 #include <nlohmann/json.hpp>
 
 #include "os/Files.h"
 #include "platform/Text.h"
 #include "service/ReportingRun.h"
-#include "tesselctl/commands/Environment.h"
+#include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/ReporterStatus.h"
-#include "tesselctl/reading/TimeArguments.h"
 #include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/SummaryOutput.h"
-#include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
 
@@ -29,6 +28,7 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   addVerdicts(json, run.classified);
   json.member("unnamed", run.unnamed).member("count_events", run.countEvents);
   json.member("rows_stored", run.rowsStored);
+  // Without books no row was expected, though the formula would still say one for the summary.
   json.member("rows_expected", hasBooks ? run.rowsExpected() : 0);
   json.object("rows_failed", [&] {
     for (const auto& [reason, count] : run.rowsFailed) json.member(reason, count);
@@ -84,7 +84,7 @@ std::string statusJson(const ReporterStatus& status) {
       json.object("forwarder", [&] { writeForwarder(json, *status.spool.forwarder); });
     json.object("journal", [&] {
       json.member("oldest", status.journal.oldest).member("keeps_a_day", status.keepsADay());
-      if (!status.journal.failure.empty()) json.member("failure", status.journal.failure);
+      if (status.journal.failure) json.member("failure", status.journal.failure->words);
     });
   });
 }
@@ -92,8 +92,10 @@ std::string statusJson(const ReporterStatus& status) {
 // One screen for a human.
 class Screen {
  public:
-  explicit Screen(const ReporterStatus& status)
-      : status_(status), terminal_(terminalBehind(STDOUT_FILENO)) {}
+  Screen(const ReporterStatus& status, const Terminal& terminal)
+      : status_(status),
+        terminal_(terminal),
+        store_(status.store.value_or("the journal of this machine")) {}
 
   std::string render() {
     line("Tasking", status_.tasking.decision.on() ? "on" : "off",
@@ -121,13 +123,9 @@ class Screen {
     std::string middle(answer);
     middle.resize(std::max(middle.size() + 1, kAnswerWidth), ' ');
     const size_t indent = kLabelWidth + kAnswerWidth;
-    const std::string right =
-        wrapped(terminalText(words), std::max(terminal_.width, indent + 12) - indent, 0);
     out_ += left + terminal_.paint(colour, middle);
-    for (const char character : right) {
-      out_ += character;
-      if (character == '\n') out_.append(indent, ' ');
-    }
+    out_ += wrappedBeside(terminalText(words), terminal_.width, indent);
+    // An answer that says it all leaves the column of words empty.
     out_.erase(out_.find_last_not_of(' ') + 1);
     out_ += '\n';
   }
@@ -155,6 +153,7 @@ class Screen {
       if (status_.hasBooks()) books(run);
       if (run.reading) store(*run.reading, run.logEvents);
     }
+    // The scheduler notes each run when it begins, the record comes at its end.
     if (status_.runWithoutRecord()) {
       more(std::string(status_.run ? "A later run began " : "A run began ") +
            since(*status_.lastBegin) +
@@ -226,6 +225,7 @@ class Screen {
         return;
     }
     const SpoolContents& spool = status_.spool;
+    // Rounded up: a spool with rows in it must not seem to be empty.
     std::string words = grouped((spool.bytes + 1023) / 1024) + " KiB";
     if (spool.oldest) {
       words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
@@ -235,6 +235,7 @@ class Screen {
   }
 
   void forwarder(const ForwarderCounters& counters) {
+    // Retries are no trouble: collectors are away now and then, and nothing is lost by waiting.
     const bool trouble = counters.rejected + counters.setAside > 0;
     std::string words = grouped(counters.delivered) + " delivered in " +
                         counted(counters.requests, "request", "requests") + ", " +
@@ -249,55 +250,57 @@ class Screen {
   }
 
   void journal() {
-    if (!status_.journal.failure.empty()) {
-      line("Journal", "unreadable", Colour::bad, status_.journal.failure);
+    if (status_.journal.failure) {
+      line("Journal", "unreadable", Colour::bad, status_.journal.failure->words);
     } else if (!status_.journal.oldest) {
-      line("Journal", "empty", Colour::plain, storeName(status_.store));
+      line("Journal", "empty", Colour::plain, store_);
     } else {
       const bool whole = status_.keepsADay();
       line("Journal", whole ? "whole day" : "part of day", whole ? Colour::good : Colour::caution,
-           storeName(status_.store) + ": oldest entry " + since(*status_.journal.oldest) +
+           store_ + ": oldest entry " + since(*status_.journal.oldest) +
                (whole ? "" : "; a run looks back 24 h"));
     }
   }
 
   const ReporterStatus& status_;
-  const Terminal terminal_;
+  const Terminal& terminal_;
+  const std::string store_;
   std::string out_;
 };
 
-int runStatus(bool json) {
-  const auto launch = launchConfiguration();
-  if (!launch) return kUsage;
-  if (::access(launch->stateDirectory.c_str(), R_OK | X_OK) != 0 && errno == EACCES) {
-    return failToRead("state directory " + launch->stateDirectory + ": " + errorWords(EACCES),
-                      launch->stateDirectory);
-  }
-  const ReporterStatus status = gatherStatus(*launch);
-  print(json ? statusJson(status) : Screen(status).render());
+struct StatusOptions {
+  bool json = false;
+};
+
+int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
+  const std::string& directory = surroundings.launch.stateDirectory;
+  // Without access every file in it would count as absent, and the screen would look well.
+  if (::access(directory.c_str(), R_OK | X_OK) != 0 && errno == EACCES)
+    return failToRead(fileError("state directory " + directory, EACCES), directory);
+  const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
+  print(options.json ? statusJson(status) : Screen(status, surroundings.terminal).render());
   std::fflush(stdout);
-  if (speaksOfPermission(status.journal.failure))
-    return failToRead(status.journal.failure, launch->traceStore);
+  if (status.journal.failure && status.journal.failure->code == ErrorCode::noAccess)
+    return failToRead(*status.journal.failure, status.store);
   if (status.spoolState == SpoolReader::State::noAccess) return kNoAccess;
   return status.good() ? kDone : kBad;
 }
 
+const CommandText kStatus{
+    "status", "Say whether this machine reports, and whether the books balance",
+    "The books of the last run balance where inspected = reported + every reason not to, and "
+    "rows\n"
+    "stored = 2 x reported (1 for an object without a name) + counts + 1. Exit status 1 where "
+    "they\n"
+    "do not, where the last run failed, and where the spool is damaged.\n\n"
+    "Example: warn from a cron job\n"
+    "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root"};
+
 }  // namespace
 
 void addStatusCommand(CLI::App& app, Invocation& invocation) {
-  CLI::App* command = app.add_subcommand(
-      "status", "Say whether this machine reports, and whether the books balance");
-  command->footer(
-      "The books of the last run balance where inspected = reported + every reason not to, and "
-      "rows\n"
-      "stored = 2 x reported (1 for an object without a name) + counts + 1. Exit status 1 where "
-      "they\n"
-      "do not, where the last run failed, and where the spool is damaged.\n\n"
-      "Example: warn from a cron job\n"
-      "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root");
-  const auto json = std::make_shared<bool>(false);
-  command->add_flag("--json", *json, "One JSON object");
-  command->callback([&invocation, json] { invocation.status = runStatus(*json); });
+  const auto [command, options] = addCommand(app, invocation, kStatus, runStatus);
+  command.add_flag("--json", options.json, "One JSON object");
 }
 
 }  // namespace tessel::ctl

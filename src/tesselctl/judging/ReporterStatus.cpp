@@ -1,3 +1,8 @@
+// Gathering what the service left on this machine.
+//
+// Nothing here takes the lock of a run: whoever asks for the status must not delay one. So the
+// facts may come from two moments, when a run ends while we look.
+
 #include "tesselctl/judging/ReporterStatus.h"
 
 #include <pwd.h>
@@ -9,8 +14,6 @@
 #include "linux/RunRecordFile.h"
 #include "linux/Scheduler.h"
 #include "linux/StateDirectory.h"
-#include "linux/SystemFacts.h"
-#include "os/Files.h"
 #include "service/ReportingRun.h"
 #include "trace/TracePointTable.h"
 
@@ -21,9 +24,11 @@ namespace {
 Marker lookForMarker() {
   struct stat facts {};
   Marker marker;
+  // The service takes anything of that name for a marker, so a broken link counts too.
   if (::lstat(cookieFilePath, &facts) != 0) return marker;
   marker.present = true;
   marker.since = Date{std::chrono::seconds{facts.st_mtim.tv_sec}};
+  // The user may be gone: a number still tells who made the marker.
   const passwd* user = ::getpwuid(facts.st_uid);
   marker.owner = user != nullptr ? user->pw_name : std::to_string(facts.st_uid);
   return marker;
@@ -34,12 +39,14 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   const StopFlag stop = false;
   auto opened = JournalStore::open(store, TimeRange{}, table, stop);
   JournalFacts facts;
-  if (const auto* error = std::get_if<PlatformError>(&opened)) {
-    facts.failure = error->words;
+  if (auto* error = std::get_if<PlatformError>(&opened)) {
+    facts.failure = std::move(*error);
     return facts;
   }
   auto& trace = *std::get<std::unique_ptr<JournalStore>>(opened);
-  trace.entries().next();  // files whose headers do not tell show their first entry
+  // Headers of closed journals tell their oldest entry. An export file has no header: it shows its
+  // oldest entry only once it is read.
+  trace.entries().next();
   if (const auto oldest = trace.report().reading.oldestEntry) {
     facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};
   }
@@ -48,10 +55,10 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
 
 }  // namespace
 
-ReporterStatus gatherStatus(const LaunchConfiguration& launch) {
+ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   const StateDirectory state = StateDirectory::forReading(launch.stateDirectory);
   ReporterStatus status;
-  status.now = SystemClock().now();
+  status.now = now;
   status.tasking = askTasking(launch);
   status.taskingWords = taskingWords(status.tasking, launch);
   status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
@@ -61,6 +68,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch) {
   SpoolReader spool(launch.stateDirectory);
   status.spoolState = spool.open();
   if (status.spoolState == SpoolReader::State::open) {
+    // A database may open well and fail at the first query.
     const auto contents = spool.contents();
     if (!contents) status.spoolState = SpoolReader::State::damaged;
     status.spool = contents.value_or(SpoolContents{});

@@ -1,7 +1,7 @@
-// ReporterStatus: what this machine says of its reporter, as `tesselctl status` shows it: the
-// tasking, the last run with its books, the marker, the spool and the journal.
+// ReporterStatus: the state of the reporter on this machine: tasking, last run with its books,
+// marker, spool and journal.
 //
-// A value, gathered once; nothing in it is written back. Threads: any.
+// A plain value. It is gathered once and does not change the machine. Any thread.
 
 #pragma once
 
@@ -11,6 +11,7 @@
 
 #include "linux/LaunchConfiguration.h"
 #include "objects/RunRecord.h"
+#include "platform/Error.h"
 #include "tesselctl/judging/Tasking.h"
 #include "tesselctl/reading/SpoolReader.h"
 
@@ -24,8 +25,8 @@ struct Marker {
 };
 
 struct JournalFacts {
-  std::optional<Date> oldest;
-  std::string failure;  // why it cannot be read; empty where it can
+  std::optional<Date> oldest;            // entry; absent where the store has none
+  std::optional<PlatformError> failure;  // absent where it can be read
 };
 
 struct ReporterStatus {
@@ -42,7 +43,7 @@ struct ReporterStatus {
   std::optional<std::string> store;  // absent: the machine's own journal
   JournalFacts journal;
 
-  // A run that got as far as sending anything.
+  // Whether the last run sent anything: only then are there sums that must balance.
   bool hasBooks() const { return run && run->hasBooks(); }
   bool good() const {
     if (run && run->outcome == RunOutcome::failed) return false;
@@ -53,11 +54,11 @@ struct ReporterStatus {
   bool keepsADay() const {
     return journal.oldest && *journal.oldest <= now - std::chrono::hours{24};
   }
-  // The scheduler knows of a run that left no record.
+  // Whether a later run than the recorded one began.
   bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
 };
 
-// Reads all of it; what cannot be read stands there as absent, with its reason.
-ReporterStatus gatherStatus(const LaunchConfiguration& launch);
+// Reads all of it. What cannot be read is absent, with its reason where there is one.
+ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now);
 
 }  // namespace tessel::ctl

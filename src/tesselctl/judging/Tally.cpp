@@ -1,4 +1,8 @@
 // Counting what a dry run finds.
+//
+// A day may hold millions of objects, so counting one must cost little: keys are compared as
+// borrowed strings, and a new key alone allocates. What is listed in the end is sorted once, by the
+// caller's demand.
 
 #include "tesselctl/judging/Tally.h"
 
@@ -14,11 +18,14 @@ using std::chrono::hours;
 using std::chrono::microseconds;
 using std::chrono::minutes;
 
+// The shortest usual length that needs no more than kMaxSlices slices. People read "each 15
+// minutes" at a glance, but not "each 17 minutes".
 microseconds sliceLengthFor(const Period& period) {
   static constexpr microseconds kLengths[] = {
       minutes{1}, minutes{2}, minutes{5}, minutes{10}, minutes{15}, minutes{30},  hours{1},
       hours{2},   hours{3},   hours{6},   hours{12},   hours{24},   hours{7 * 24}};
-  // One more slice than fits, since the first and the last may be cut.
+  // Slices begin at round times and the period need not, so the first and the last may be cut. That
+  // takes up to two slices more than the division says.
   for (const microseconds length : kLengths) {
     if (period.length() / length + 2 <= static_cast<int64_t>(Tally::kMaxSlices)) return length;
   }
@@ -26,7 +33,9 @@ microseconds sliceLengthFor(const Period& period) {
   return (period.length() / (static_cast<int64_t>(Tally::kMaxSlices - 2) * week) + 1) * week;
 }
 
-// The beginning of the slice that holds `date`, counted from a local midnight.
+// The beginning of the slice that holds `date`. Slices count from a local midnight, so that they
+// begin at full hours for people. Where summer time begins within the period, the later slices keep
+// the offset of the first: they are of equal length, but an hour off.
 Date sliceHolding(Date date, microseconds length) {
   const std::time_t whole =
       std::chrono::floor<std::chrono::seconds>(date).time_since_epoch().count();
@@ -34,6 +43,7 @@ Date sliceHolding(Date date, microseconds length) {
   localtime_r(&whole, &parts);
   const microseconds offset = std::chrono::seconds{parts.tm_gmtoff};
   const microseconds local = date.time_since_epoch() + offset;
+  // The remainder of a date before 1970 is negative.
   const microseconds into = (local % length + length) % length;
   return date - into;
 }
@@ -74,12 +84,15 @@ void Tally::countKind(const TesselObject& object, bool reported) {
 
 void Tally::countSlice(TesselReporterClassification classification, uint64_t realtime) {
   const Date date{microseconds{static_cast<int64_t>(realtime)}};
+  // An interval belongs to the time of its end. Following passes the end of the period.
   if (date < firstSlice_) return;
   const auto slice = static_cast<size_t>((date - firstSlice_) / sliceLength_);
   if (slice < slices_.size()) ++slices_[slice][classification];
 }
 
 void Tally::countMiss(const TesselObject& object, const FilterDecision& decision) {
+  // Values come from programs and may differ each time. The list is bounded by number and by bytes;
+  // what it cannot take is counted, so that the sums still balance.
   const decltype(misses_)::Key key{
       {object.subsystem(), object.category(), object.name(), decision.stringValue},
       decision.stringSlot};

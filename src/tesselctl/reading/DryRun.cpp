@@ -1,4 +1,10 @@
-// Reading a store as a run does.
+// Reading a store as a run does, once or again and again.
+//
+// Following reads the store anew every quarter of a second from shortly before its last entry, and
+// passes on what it has not passed on before. A watch on the files would not spare that: it says
+// that a file changed, not which entries are new, and an entry of another file may be stamped
+// earlier than the last one we saw. The price is to read the last seconds of the store in each
+// look.
 
 #include "tesselctl/reading/DryRun.h"
 
@@ -13,13 +19,16 @@ namespace tessel::ctl {
 
 namespace {
 
+// "Within a second" is what we promise for --follow.
 constexpr std::chrono::milliseconds kLookInterval{250};
-// Entries of several files and boots come in an order of their own: what is stamped this much
-// before the latest entry may still be new.
+// Microseconds. The daemon stamps an entry before it writes it, and one file may be written later
+// than another. An entry stamped this long before the latest one may still be new.
 constexpr uint64_t kOverlap = 5'000'000;
+// The listener is told every 4,096 entries: it looks at the clock, which would slow each entry
+// down.
 constexpr uint64_t kProgressMask = 0xfff;
 
-// Tells a listener how far another stream is.
+// Passes another stream on and tells a listener how far it is.
 class WatchedStream final : public EntryStream {
  public:
   WatchedStream(EntryStream& source, TimeRange range, const DryRun::Progress& progress)
@@ -44,8 +53,8 @@ class WatchedStream final : public EntryStream {
   uint64_t entries_ = 0;
 };
 
-// Passes on what was not passed on in an earlier look. An entry is known by what its header says;
-// where several look the same, by how many there are.
+// Knows which entries were passed on in an earlier look. Export files may hold several entries with
+// the same header, so we count them: the third one of a kind is new after a look that saw two.
 class NewEntries {
  public:
   // From which time on a look must read.
@@ -61,7 +70,8 @@ class NewEntries {
     const auto known = passedOn_.find(identity);
     return known == passedOn_.end() || number > known->second.number;
   }
-  // `now`: what claims to be of the future does not move the window there.
+  // An entry with a time in the future must not move the window there: entries of today would then
+  // count as old. So the window never passes `now`.
   void endLook(uint64_t now) {
     for (const auto& [identity, seen] : inThisLook_) {
       Seen& known = passedOn_[identity];
@@ -78,6 +88,8 @@ class NewEntries {
     uint32_t number = 0;
     uint64_t realtime = 0;
   };
+  // Entries are told apart by 64 bits of their header, so that a busy store needs little memory. If
+  // two collide, the later one is not shown.
   static uint64_t identityOf(const EntryHeader& header) {
     const uint64_t parts[] = {header.sequenceNumber, header.monotonic, header.realtime,
                               header.contentHash};

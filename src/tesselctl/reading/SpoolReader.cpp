@@ -1,4 +1,9 @@
-// Reading the spool.
+// Reading the spool beside the service.
+//
+// A database with a write-ahead log needs an index file beside it, which even a reader must be able
+// to make. A user who may only read would therefore see nothing. For him we open the database as
+// immutable, which needs no index, but only while there is no log: what stands in a log would be
+// missing without a word.
 
 #include "tesselctl/reading/SpoolReader.h"
 
@@ -9,13 +14,13 @@
 #include <cerrno>
 
 #include "os/Files.h"
-#include "os/UniqueFd.h"
 #include "statora/Spool.h"
 
 namespace tessel::ctl {
 
 namespace {
 
+// The service holds its lock for milliseconds. After two seconds something is wrong.
 constexpr int kBusyMilliseconds = 2000;
 
 uint64_t sizeOf(const std::string& path) {
@@ -23,6 +28,7 @@ uint64_t sizeOf(const std::string& path) {
   return ::stat(path.c_str(), &facts) == 0 ? static_cast<uint64_t>(facts.st_size) : 0;
 }
 
+// SQLite says "cannot open" where it may not make its files, so that counts as well.
 bool forbids(const SqliteStatus& status) {
   const int code = status.primaryCode();
   return code == SQLITE_CANTOPEN || code == SQLITE_PERM || code == SQLITE_READONLY;
@@ -33,6 +39,7 @@ bool forbids(const SqliteStatus& status) {
 SpoolReader::SpoolReader(const std::string& stateDirectory)
     : path_(stateDirectory + "/" + kSpoolFileName) {}
 
+// The service sets a damaged spool aside by renaming it. Our database would still be the old one.
 bool SpoolReader::sameFile() const {
   struct stat facts {};
   return ::stat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
@@ -45,10 +52,10 @@ SpoolReader::State SpoolReader::open() {
   const UniqueFd file(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
   struct stat facts {};
   if (!file.valid() || ::fstat(file.get(), &facts) != 0) {
-    const int error = errno;
-    reason_ = path_ + ": " + errorWords(error);
-    return error == ENOENT                     ? State::absent
-           : error == EACCES || error == EPERM ? State::noAccess
+    const PlatformError error = fileError(path_, errno);
+    reason_ = error.words;
+    return error.code == ErrorCode::notFound   ? State::absent
+           : error.code == ErrorCode::noAccess ? State::noAccess
                                                : State::damaged;
   }
   device_ = facts.st_dev;
@@ -60,12 +67,13 @@ SpoolReader::State SpoolReader::openDatabase() {
   SqliteStatus status = database_.open(path_, SqliteDatabase::Mode::readOnly);
   if (status.ok()) {
     database_.setBusyTimeout(kBusyMilliseconds);
+    // Opening reads nothing yet. Only a query shows whether this is a spool.
     if (database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)"))
       return State::open;
     status = database_.status();
     database_.close();
   }
-  // Without a write-ahead log nobody is writing, so nothing is missed by not looking for one.
+  // An empty log, or none, means that the database itself holds every row.
   if (forbids(status) && sizeOf(path_ + "-wal") == 0) {
     status = database_.open(path_, SqliteDatabase::Mode::immutable);
     if (status.ok() && database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)"))

@@ -1,8 +1,7 @@
-// SpoolReader: the analytics spool as somebody beside the service reads it.
+// SpoolReader: the analytics spool, read beside the service.
 //
-// Reads while the service writes, and follows when the spool is replaced. Never writes; where the
-// reader may not even make SQLite's bookkeeping files, the database is read as it stands.
-// Threads: one at a time.
+// Reads while the service writes, and never writes itself. If the service replaces the spool, the
+// next open() follows. One thread at a time.
 
 #pragma once
 
@@ -42,8 +41,8 @@ class SpoolReader {
   explicit SpoolReader(const std::string& stateDirectory);
 
   const std::string& path() const { return path_; }
-  // Opens the spool, or opens it anew where another file stands in its place by now; what was read
-  // of the old one no longer counts then.
+  // Opens the spool. If another file stands in its place by now, opens that one, and readNew()
+  // begins with its first row.
   State open();
   // Why it is not open, in words.
   const std::string& reason() const { return reason_; }

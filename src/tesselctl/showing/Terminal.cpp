@@ -195,17 +195,19 @@ std::string Table::render(const Terminal& terminal, size_t indent) const {
   return out;
 }
 
-std::string wrapped(std::string_view text, size_t width, size_t indent) {
+namespace {
+
+// `used` columns of the first line are taken already.
+std::string wrappedBehind(size_t used, std::string_view text, size_t width, size_t indent) {
   std::string out;
-  size_t used = 0;
   while (!text.empty()) {
     const size_t end = std::min(text.find(' '), text.size());
     const std::string word = shortened(text.substr(0, end), width - std::min(indent, width));
     const size_t wordWidth = displayWidth(word);
-    if (used > 0 && used + 1 + wordWidth > width) {
+    if (!out.empty() && used + 1 + wordWidth > width) {
       out.append("\n").append(indent, ' ');
       used = indent;
-    } else if (used > 0) {
+    } else if (!out.empty()) {
       out += ' ';
       ++used;
     }
@@ -214,6 +216,16 @@ std::string wrapped(std::string_view text, size_t width, size_t indent) {
     text.remove_prefix(std::min(end + 1, text.size()));
   }
   return out;
+}
+
+}  // namespace
+
+std::string wrapped(std::string_view text, size_t width, size_t indent) {
+  return wrappedBehind(0, text, width, indent);
+}
+
+std::string wrappedBeside(std::string_view text, size_t width, size_t indent) {
+  return wrappedBehind(indent, text, std::max(width, indent + 12), indent);
 }
 
 // Whoever reads a pipe may leave early, as `head` does. There is nobody left to complain to, so the

@@ -73,6 +73,9 @@ class Table {
 // `text` broken between words to `width` columns; lines after the first begin with `indent` spaces.
 // A word that is longer than a line stands alone and loses its middle.
 std::string wrapped(std::string_view text, size_t width, size_t indent);
+// The same beside a label of `indent` columns, which the caller writes before the first line. On a
+// terminal too narrow for that, lines are 12 columns wide behind the label.
+std::string wrappedBeside(std::string_view text, size_t width, size_t indent);
 
 // One JSON object on a line of its own. `write(JsonWriter&)` writes its members.
 template <typename Write>

@@ -1,0 +1,153 @@
+// The environment, the options for reading a store, and failures in words.
+
+#include "tesselctl/commands/Command.h"
+
+#include <fnmatch.h>
+#include <unistd.h>
+
+#include <algorithm>
+
+#include "linux/SystemFacts.h"
+#include "platform/Text.h"
+#include "tasking/TaskingGate.h"
+#include "whitelist/PlatformProfile.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+// The exit status comes from the code alone. A path may hold any words, "Permission denied" too.
+ExitStatus statusOf(const PlatformError& error) {
+  return error.code == ErrorCode::noAccess ? kNoAccess : kBad;
+}
+
+// Says the error and, where access was refused, what to do about it.
+int failWithHint(const PlatformError& error, const char* hint) {
+  const ExitStatus status = statusOf(error);
+  fail(status, error.words);
+  if (status == kNoAccess) printError(hint);
+  return status;
+}
+
+}  // namespace
+
+int fail(ExitStatus status, const std::string& message) {
+  printError("tesselctl: " + terminalText(message) + "\n");
+  return status;
+}
+
+int failToRead(const PlatformError& error, const std::optional<std::string>& store) {
+  return failWithHint(
+      error, store ? "Run tesselctl as a user who may read the store.\n"
+                   : "Join the group:  sudo usermod --append --groups systemd-journal $USER\n"
+                     "and log in again, or run tesselctl as root.\n");
+}
+
+int failToWrite(const PlatformError& error) {
+  return failWithHint(error,
+                      "Run tesselctl as root, or as the user that the directory belongs to.\n");
+}
+
+// Refused files come first: that can be mended by another user, a store of too many files cannot.
+int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string>& store) {
+  const auto refused = [](const FileReport& file) { return file.refused; };
+  const auto first = std::find_if(report.files.begin(), report.files.end(), refused);
+  if (first != report.files.end()) {
+    const auto count = std::count_if(first, report.files.end(), refused);
+    return failToRead({ErrorCode::noAccess, counted(static_cast<uint64_t>(count), "file", "files") +
+                                                " of the store could not be read, the first is " +
+                                                first->path + ": " + first->skipped.value_or("")},
+                      store);
+  }
+  const uint64_t notLookedAt = report.reading.losses.sum(LossCode::filesNotLookedAt);
+  if (notLookedAt == 0) return kDone;
+  return fail(
+      kBad, counted(notLookedAt, "file", "files") + " of the store were one too many and not read");
+}
+
+std::optional<Surroundings> lookAround() {
+  auto launch = readLaunchConfiguration(processEnvironment());
+  if (const auto* error = std::get_if<LaunchError>(&launch)) {
+    fail(kUsage, error->line());
+    return {};
+  }
+  return Surroundings{std::get<LaunchConfiguration>(std::move(launch)), SystemClock().now(),
+                      terminalBehind(STDOUT_FILENO)};
+}
+
+void addPeriodOptions(CLI::App& command, ReadingOptions& options) {
+  command.add_option(
+      "--store", options.store,
+      "Directory with *.journal and *.export files, or one such file [$TESSEL_TRACE_STORE, "
+      "else the machine's journal]");
+  command.add_option("--since", options.period.since,
+                     "Begin of the period: 2026-11-22, '2026-11-22 21:45', 21:45, yesterday, -24h, "
+                     "'2 hours ago' [a day before its end]");
+  command.add_option("--until", options.period.until, "End of the period, in the same forms [now]");
+  command.add_option("--last", options.period.last,
+                     "Length of the period, up to its end: 30m, 24h, 7d");
+}
+
+void addJudgeOptions(CLI::App& command, ReadingOptions& options) {
+  command.add_option("--platform", options.platform,
+                     "Judge as on this platform: " + platformNames() + " [this build's]");
+  const auto internal =
+      command.add_flag("--internal", options.internal,
+                       "Judge as on a build with internal diagnostics [as this machine says]");
+  command.add_flag("--no-internal", options.external, "Judge as on any other build")
+      ->excludes(internal);
+}
+
+CLI::Option* addPatterns(CLI::App& command, const char* name, std::vector<std::string>& patterns,
+                         const char* help) {
+  // One word for each --name. With more, the option would swallow the words behind it.
+  return command.add_option(name, patterns, help)->allow_extra_args(false)->type_name("PATTERN");
+}
+
+bool fitsOne(const std::vector<std::string>& patterns, const std::string& text) {
+  return patterns.empty() ||
+         std::any_of(patterns.begin(), patterns.end(), [&](const std::string& pattern) {
+           return ::fnmatch(pattern.c_str(), text.c_str(), 0) == 0;
+         });
+}
+
+std::optional<TesselReporterPlatform> platformNamed(const std::string& name) {
+  // The names are matched exactly, as the service matches them.
+  const auto platform = platformFromName(SharedString(name));
+  return platform == TesselReporterPlatform::unknown ? std::nullopt : std::optional(platform);
+}
+
+std::optional<Reading> readingOf(const ReadingOptions& options, const Surroundings& surroundings) {
+  const LaunchConfiguration& launch = surroundings.launch;
+  Reading reading;
+  reading.store = options.store ? options.store : launch.traceStore;
+  const PeriodResult period = periodOf(options.period, surroundings.now);
+  if (!period.period) {
+    fail(kUsage, period.error);
+    return {};
+  }
+  reading.period = *period.period;
+  if (options.platform) {
+    const auto platform = platformNamed(*options.platform);
+    if (!platform) {
+      fail(kUsage, "--platform: '" + *options.platform + "' is none of " + platformNames());
+      return {};
+    }
+    reading.machine.platform = *platform;
+  }
+  reading.machine.internal =
+      options.internal ||
+      (!options.external &&
+       OsReleaseBuildVariant(launch.osReleasePath).hasInternalDiagnostics(kBuildVariantSubsystem));
+  return reading;
+}
+
+std::optional<PlatformError> readWithProgress(DryRun& run, const Period& period, bool shown,
+                                              double begin, double end) {
+  ProgressBar bar(shown);
+  return run.read(period, [&](double part, uint64_t entries) {
+    bar.update(begin + part * (end - begin), entries);
+  });
+}
+
+}  // namespace tessel::ctl

@@ -1,0 +1,161 @@
+// defer and tasking: the two switches of the service, each a file that the service looks for.
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <initializer_list>
+#include <nlohmann/json.hpp>
+
+#include "linux/StateDirectory.h"
+#include "os/Files.h"
+#include "platform/Text.h"
+#include "statora/ConfigurationFiles.h"
+#include "tasking/TaskingGate.h"
+#include "tesselctl/commands/Command.h"
+#include "tesselctl/judging/Tasking.h"
+
+namespace tessel::ctl {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+// The service runs as a user of its own and must be able to read what we write as root.
+constexpr unsigned kReadableByAll = 0644;
+
+struct SwitchOptions {
+  bool json = false;
+};
+struct Position {
+  const char* name;
+  const char* description;
+  int (*take)(const SwitchOptions&, const Surroundings&);
+};
+
+void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, const char* json,
+               std::initializer_list<Position> positions) {
+  const auto options = std::make_shared<SwitchOptions>();
+  CLI::App* command = app.add_subcommand(text.name, text.description);
+  command->footer(text.footer);
+  command->add_flag("--json", options->json, json);
+  command->require_subcommand(1);
+  command->fallthrough();
+  for (const auto& [name, description, take] : positions)
+    setAction(*command->add_subcommand(name, description), invocation, options, take);
+}
+
+std::string deferFile(const Surroundings& surroundings) {
+  return StateDirectory::forReading(surroundings.launch.stateDirectory).deferFile();
+}
+
+int showDeferral(const SwitchOptions& options, bool wanted, bool changed, const std::string& file) {
+  if (options.json) {
+    print(objectLine([&](JsonWriter& json) {
+      json.member("defer", wanted).member("changed", changed).member("file", file);
+    }));
+  } else if (wanted) {
+    print(changed ? "Runs are put off from now on; a run under way ends within 10 seconds.\n"
+                  : "Runs were put off already.\n");
+  } else {
+    print(changed ? "Runs are no longer put off.\n" : "Runs were not put off.\n");
+  }
+  return kDone;
+}
+
+int deferOn(const SwitchOptions& options, const Surroundings& surroundings) {
+  const std::string file = deferFile(surroundings);
+  const bool made = createNewFile(file, kReadableByAll);
+  const int error = errno;
+  if (!made && error != EEXIST) return failToWrite(fileError(file, error));
+  if (!surroundings.launch.deferOn.file) {
+    printError(
+        "TESSEL_DEFER_ON does not name \"file\": a service started like this does not look for "
+        "it.\n");
+  }
+  return showDeferral(options, true, made, file);
+}
+
+int deferOff(const SwitchOptions& options, const Surroundings& surroundings) {
+  const std::string file = deferFile(surroundings);
+  const bool removed = ::unlink(file.c_str()) == 0;
+  const int error = errno;
+  if (!removed && error != ENOENT) return failToWrite(fileError(file, error));
+  return showDeferral(options, false, removed, file);
+}
+
+// The configuration with the new answer. It may hold keys of others, which stay.
+std::string changedConfiguration(const std::string& file, bool on) {
+  const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
+  Json configuration = text ? Json::parse(*text, nullptr, false) : Json::object();
+  if (!configuration.is_object()) configuration = Json::object();
+  configuration[kTaskedOnKey] = on;
+  return configuration.dump(2, ' ', false, Json::error_handler_t::replace) + "\n";
+}
+
+int showTasking(const SwitchOptions& options, const Surroundings& surroundings) {
+  const Tasking tasking = askTasking(surroundings.launch);
+  if (options.json) {
+    print(objectLine([&](JsonWriter& json) {
+      json.member("tasked", tasking.decision.on());
+      json.member("source", taskingSourceName(tasking.decision.source()));
+      json.member("file", tasking.file);
+    }));
+  } else {
+    const bool on = tasking.decision.on();
+    print(surroundings.terminal.paint(on ? Colour::good : Colour::caution, on ? "on" : "off") +
+          ": " + terminalText(taskingWords(tasking, surroundings.launch)) + "\n");
+  }
+  return kDone;
+}
+
+int switchTasking(const SwitchOptions& options, const Surroundings& surroundings, bool on) {
+  const std::string& directory = surroundings.launch.configurationDirectory;
+  std::error_code error;
+  if (!std::filesystem::is_directory(directory, error))
+    std::filesystem::create_directories(directory, error);
+  if (error) return failToWrite(fileError(directory, error.value()));
+  // The service watches the file and may read it while we write. It finds the old text or the new.
+  const std::string file = taskingFile(surroundings.launch);
+  if (const auto failure = replaceFileDurably(file, changedConfiguration(file, on), kReadableByAll))
+    return failToWrite(*failure);
+  return showTasking(options, surroundings);
+}
+int taskingOn(const SwitchOptions& options, const Surroundings& surroundings) {
+  return switchTasking(options, surroundings, true);
+}
+int taskingOff(const SwitchOptions& options, const Surroundings& surroundings) {
+  return switchTasking(options, surroundings, false);
+}
+
+const CommandText kDefer{
+    "defer", "Put the service's runs off, or no longer",
+    "A run that is put off is offered again every 15 minutes. Written is the file 'defer' in "
+    "the\n"
+    "state directory ($TESSEL_STATE_DIR).\n\n"
+    "Example: keep the machine free for a measurement\n"
+    "  tesselctl defer on; ./measure; tesselctl defer off"};
+
+const CommandText kTasking{
+    "tasking", "Switch reporting on or off, or show which it is",
+    "Written is the tasking configuration in the configuration directory ($TESSEL_CONFIG_DIR).\n"
+    "A build with internal diagnostics reports whatever it says.\n\n"
+    "Example: switch reporting on, and see that it is\n"
+    "  sudo tesselctl tasking on\n"
+    "  tesselctl tasking show"};
+
+}  // namespace
+
+void addDeferCommand(CLI::App& app, Invocation& invocation) {
+  addSwitch(app, invocation, kDefer, "One JSON object: defer, changed, file",
+            {{"on", "Put runs off", deferOn}, {"off", "Let runs take place", deferOff}});
+}
+
+void addTaskingCommand(CLI::App& app, Invocation& invocation) {
+  addSwitch(app, invocation, kTasking, "One JSON object: tasked, source, file",
+            {{"on", "Report", taskingOn},
+             {"off", "Do not report", taskingOff},
+             {"show", "Say whether this machine reports, and what says so", showTasking}});
+}
+
+}  // namespace tessel::ctl
