@@ -1,11 +1,12 @@
 // TesselSupportObjectExtractor: the trace-extraction service as the service uses it.
 //
-// One extractor serves one run: the callbacks and the option are set, one processing call is made,
-// and processedEventCount() is read after it returned.
+// One extractor serves one run. The run sets the callbacks and the option, makes one processing
+// call, and asks for the results after that has returned.
 //
-// Delivery: one object per callback call, one call at a time, every call before the processing
-// call returns; a callback may sleep. An animation interval goes to the animation callback only.
-// A delivered object stays valid and unchanged for as long as somebody holds it.
+// Delivery: a callback gets one object per call. Calls come one at a time, and all of them before
+// the processing call returns; a callback may sleep. An animation interval only goes to the
+// animation callback. A delivered object stays valid and unchanged for as long as somebody holds
+// it.
 //
 // Threads: stopProcessing() may be called from any thread, before, during and after processing,
 // and never waits for a callback. Everything else belongs to the thread of the run.
@@ -40,16 +41,16 @@ class TesselSupportObjectExtractor {
   virtual void setEmitEventProcessingBlock(EventCallback callback) = 0;
   virtual void setBuildAnimationCompositeIntervalTimelines(bool build) = 0;
 
-  // Delivers the trace points recorded in [startDate, endDate) from the store at `path`, the
-  // system's own where it is absent. Blocks until all are delivered or a stop took effect. False
-  // where processing failed; `errorOut` then holds why.
+  // Delivers the trace points recorded in [startDate, endDate) from the store at `path`; an absent
+  // path means the system's own. Blocks until all are delivered or a stop has taken effect. False
+  // if processing failed; `errorOut` then says why.
   virtual bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
                                          Date endDate, std::optional<PlatformError>& errorOut) = 0;
   // Ends the processing call early. A stop before the call began makes it return at once.
   virtual void stopProcessing() = 0;
   // Log events that the last processing call read, trace points or not.
   virtual uint64_t processedEventCount() const = 0;
-  // What the last processing call read of the store, and what was lost; absent where there was no
+  // What the last processing call read of the store, and what was lost; absent if there was no
   // store to read.
   virtual std::optional<StoreReading> reading() const = 0;
 };

@@ -110,14 +110,14 @@ RunRecord TraceReading::report(const std::shared_ptr<Activity>& activity) {
   status_.say("summarising");
   RunRecord record =
       endedWith(failure ? RunOutcome::failed : RunOutcome::completed, failure.value_or(""));
+  record.logEvents = extractor->processedEventCount();
   // On the queue behind all sends of the run, so what it sums up has been sent before.
   reportingQueue_.sync([&] {
-    record.countEvents =
-        summary_.reportRunSummary(filter, *extractor, startDate, endDate, *interrupted, startTime);
+    record.countEvents = summary_.reportRunSummary(filter, record.logEvents, startDate, endDate,
+                                                   *interrupted, startTime);
   });
   // A deferral may come as late as during the summary; it is asked for last.
   if (!failure && *interrupted) record.outcome = RunOutcome::interrupted;
-  record.logEvents = extractor->processedEventCount();
   record.reading = extractor->reading();
   record.unnamed = reporter->unnamedCount();
   record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();

@@ -49,12 +49,11 @@ Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count,
   return payload;
 }
 
-Payload runSummaryPayload(const TesselReporterObjectFilter& filter,
-                          const TesselSupportObjectExtractor& extractor, float seconds,
-                          bool interrupted) {
+Payload runSummaryPayload(const TesselReporterObjectFilter& filter, uint64_t logEvents,
+                          float seconds, bool interrupted) {
   Payload payload;
   payload.set("ProcessingDurationInSeconds", Number{seconds});
-  payload.set("LogObjectsProcessed", Number{extractor.processedEventCount()});
+  payload.set("LogObjectsProcessed", Number{logEvents});
   payload.set("AnimationsReported", Number{filter.totalReportedAnimationCount()});
   payload.set("IntervalsReported", Number{filter.totalReportedIntervalCount()});
   payload.set("EventsReported", Number{filter.totalReportedEventCount()});
@@ -83,14 +82,14 @@ uint64_t CountReporter::reportCountForKey(const TesselReporterAggregationKey& ke
   return count;
 }
 
-uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
-                                      const TesselSupportObjectExtractor& extractor, Date startDate,
-                                      Date endDate, const std::atomic<bool>& interruptedByDeferral,
+uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter, uint64_t logEvents,
+                                      Date startDate, Date endDate,
+                                      const std::atomic<bool>& interruptedByDeferral,
                                       uint64_t processingStartTime) {
   const uint64_t countEvents = reportSections(filter);
   const float seconds = secondsSince(processingStartTime);
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
-                    runSummaryPayload(filter, extractor, seconds, interruptedByDeferral));
+                    runSummaryPayload(filter, logEvents, seconds, interruptedByDeferral));
   const LogHandle& log = tesselReporterLog();
   // Formatting two dates costs more than all the counts, so it is not done for nobody.
   if (log.isEnabled(LogLevel::debug)) {
@@ -106,8 +105,8 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter,
         filter.telemetryNotReportedFailedSCFilterAggregation().totalCount(),
         filter.telemetryNotReportedDurationThresholdAggregation().totalCount(),
         filter.telemetryNotReportedFailedStringWhitelistAggregation().totalCount(),
-        filter.telemetryDisabledAggregation().totalCount(), extractor.processedEventCount(),
-        static_cast<double>(seconds), dates_.format(startDate), dates_.format(endDate),
+        filter.telemetryDisabledAggregation().totalCount(), logEvents, static_cast<double>(seconds),
+        dates_.format(startDate), dates_.format(endDate),
         interruptedByDeferral ? " (Interrupted by deferral)" : "");
   }
   if (throttle_.throttledCount() != 0) {

@@ -13,7 +13,6 @@
 #include <string_view>
 
 #include "filter/TesselReporterObjectFilter.h"
-#include "objects/TesselSupportObjectExtractor.h"
 #include "platform/Analytics.h"
 #include "platform/System.h"
 
@@ -44,12 +43,13 @@ class RunSummary {
              ServiceStatus& status)
       : sender_(sender), throttle_(throttle), clock_(clock), dates_(dates), status_(status) {}
 
-  // `startDate` and `endDate` bound the period that was read; `processingStartTime` is in ticks of
-  // the continuous clock. `interruptedByDeferral` may change while the summary runs, because the
-  // deferral poll does not stop for it. Answers how many count events were sent.
-  uint64_t reportRunSummary(const TesselReporterObjectFilter& filter,
-                            const TesselSupportObjectExtractor& extractor, Date startDate,
-                            Date endDate, const std::atomic<bool>& interruptedByDeferral,
+  // `logEvents` is how many the extractor read. `startDate` and `endDate` bound the period that was
+  // read; `processingStartTime` is in ticks of the continuous clock. `interruptedByDeferral` may
+  // change while the summary runs, because the deferral poll does not stop for it. Answers how many
+  // count events were sent.
+  uint64_t reportRunSummary(const TesselReporterObjectFilter& filter, uint64_t logEvents,
+                            Date startDate, Date endDate,
+                            const std::atomic<bool>& interruptedByDeferral,
                             uint64_t processingStartTime);
 
  private:
