@@ -154,7 +154,7 @@ class EndlessStream final : public EntryStream {
   EntryHeader header_;
 };
 
-TEST_F(JournalExtractorTest, aStopFromAnotherThreadTakesEffectWhereNothingIsDelivered) {
+TEST_F(JournalExtractorTest, aStopTakesEffectWhereNothingIsDelivered) {
   EndlessStream stream;
   JournalExtractor& running = extractor();  // made before there are two threads
   std::thread stopper([&] { running.stopProcessing(); });
