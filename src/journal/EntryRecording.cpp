@@ -16,13 +16,11 @@
 #include <chrono>
 #include <ctime>
 #include <filesystem>
-#include <fstream>
 #include <string>
 #include <system_error>
 
 #include "journal/EntryStream.h"
 #include "os/Files.h"
-#include "os/UniqueFd.h"
 
 namespace tessel {
 
@@ -42,15 +40,14 @@ uint64_t microsecondsOf(clockid_t clock) {
   return static_cast<uint64_t>(now.tv_sec) * 1'000'000 + static_cast<uint64_t>(now.tv_nsec) / 1000;
 }
 
+// Of a file in /proc; empty if it cannot be read.
 std::string firstLineOf(const char* path) {
-  std::string line;
-  std::ifstream file(path);
-  std::getline(file, line);
-  return line;
+  const std::string text = readSmallFile(path, 4096).value_or("");
+  return text.substr(0, text.find('\n'));
 }
 
 PlatformError failure(const std::string& path, const std::string& doing, int error) {
-  return {codeOf(error), "Cannot " + doing + " " + path + ": " + errorWords(error)};
+  return fileError("Cannot " + doing + " " + path, error);
 }
 
 // The daemon's hash depends on the file. Ours (FNV-1a) only has to be the same for equal entries,

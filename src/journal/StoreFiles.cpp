@@ -9,13 +9,13 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <fstream>
 #include <memory>
 #include <set>
 #include <string_view>
 #include <utility>
 
 #include "os/Files.h"
+#include "platform/Text.h"
 
 namespace tessel {
 
@@ -153,9 +153,8 @@ PlatformError storeError(const std::string& path, int error) {
 // The daemon keeps its files under /var if that directory exists, otherwise under /run. After it
 // was created, both hold a part, so both are read; one of them is enough.
 std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
-  std::string machine;
   // Other machines' journals may lie beside ours, in directories named after their ids.
-  std::ifstream("/etc/machine-id") >> machine;
+  const std::string machine(trimmed(readSmallFile("/etc/machine-id", 4096).value_or("")));
   if (machine.empty())
     return PlatformError{ErrorCode::notFound,
                          "/etc/machine-id: the machine has no identity, so no journal"};
