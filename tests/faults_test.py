@@ -253,7 +253,7 @@ class Permission(MachineTest):
                                 capture_output=True, text=True, timeout=120, check=False)
         self.assertEqual(result.returncode, 0, result.stderr)
         self.assertEqual(dict(self.machine.rows()[-1][1])["EventsReported"], 3)
-        named = [line for line in result.stderr.splitlines() if "was not read" in line]
+        named = [line for line in result.stderr.splitlines() if "1 file_skipped: Permission denied" in line]
         self.assertEqual(len(named), 3, result.stderr)
         for number, line in zip((0, 2, 4), named):
             self.assertIn(f"{number}.export", line)
