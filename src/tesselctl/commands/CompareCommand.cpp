@@ -128,7 +128,7 @@ struct Comparison {
   Losses losses;      // of each reading
 };
 
-void addReading(const DryRun& run, Comparison& comparison) {
+void takeReading(const DryRun& run, Comparison& comparison) {
   comparison.store = run.report().store;
   comparison.losses.add(comparison.store.reading.losses);
 }
@@ -151,7 +151,7 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
     return true;
   });
   comparison.error = readWithProgress(run, settings[0].period);
-  addReading(run, comparison);
+  takeReading(run, comparison);
 }
 
 // What became of one trace point in each of two periods.
@@ -195,7 +195,7 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
     // Each period is half of the work on the progress bar.
     const double half = static_cast<double>(side) / 2;
     comparison.error = readWithProgress(run, settings[side].period, true, half, half + 0.5);
-    addReading(run, comparison);
+    takeReading(run, comparison);
   }
   for (const auto& [path, figures] : paths) {
     const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];

@@ -24,6 +24,7 @@ std::vector<Loss> toldApart(const Losses& losses, LossCode code) {
 
 }  // namespace
 
+// No loss with a count: nobody knows how many entries the journal has already removed.
 std::string partOfPeriod(const StoreReading& reading) {
   if (!reading.oldestEntry || reading.reachesRangeStart()) return {};
   const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*reading.oldestEntry)}};
