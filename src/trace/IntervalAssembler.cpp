@@ -1,4 +1,4 @@
-// Reading one trace point, pairing, and the making of objects.
+// Sorting the tokens of an entry into slots, pairing begins with ends, and making the objects.
 
 #include "trace/IntervalAssembler.h"
 
@@ -12,12 +12,9 @@ FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }
 
-// The kinds of the labelled arguments stand in the order label, value, label, value.
-constexpr FieldKind inSlot(FieldKind ofFirstSlot, size_t slot) {
-  return static_cast<FieldKind>(static_cast<size_t>(ofFirstSlot) + 2 * slot);
-}
-static_assert(inSlot(FieldKind::string1Name, kLabelledStrings) == FieldKind::number1Name &&
-              inSlot(FieldKind::number1Name, kLabelledNumbers) == FieldKind::duration);
+// The rows of the journal fields and the slots of the objects have the same labelled arguments.
+static_assert(labelled(FieldKind::string1Name, kLabelledStrings) == FieldKind::number1Name &&
+              labelled(FieldKind::number1Name, kLabelledNumbers) == FieldKind::duration);
 
 }  // namespace
 
@@ -61,6 +58,8 @@ void IntervalAssembler::take(const Entry& entry) {
     return;
   }
   ++counts_.tracePoints;
+  // The daemon looks up _EXE after it received the entry. A process that is gone by then leaves
+  // none, and without it nobody can say which program the object is from.
   if (point_[FieldKind::imagePath] == kNoToken) ++counts_.withoutImagePath;
   switch (table_.pointKind(point_[FieldKind::pointKind])) {
     case PointKind::event:
@@ -72,7 +71,8 @@ void IntervalAssembler::take(const Entry& entry) {
   }
 }
 
-// Whether an entry has one of the fields that a trace point must have, good or not.
+// An entry with one of the required fields, good or bad, means to be a trace point: where the
+// others are missing that is counted. Any other entry of the journal is none of our business.
 bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens) const {
   return std::any_of(tokens.begin(), tokens.end(), [this](FieldToken token) {
     const FieldKind kind = TracePointTable::kind(token);
@@ -80,6 +80,8 @@ bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens)
   });
 }
 
+// Where a field occurs more than once, its last value counts. The buffers are kept from entry to
+// entry, so that most entries allocate nothing.
 void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   point_.tokens.fill(kNoToken);
   point_.attributes.clear();
@@ -96,11 +98,12 @@ void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   }
 }
 
+// An entry with several faults is counted under one reason, so that the reasons add up to entries.
 std::optional<MalformedReason> IntervalAssembler::fault() const {
   if (point_.malformed != kNoToken) return table_.malformedReason(point_.malformed);
-  if (point_[FieldKind::pointKind] == kNoToken) return MalformedReason::missingKind;
-  if (point_[FieldKind::subsystem] == kNoToken) return MalformedReason::missingSubsystem;
-  if (point_[FieldKind::category] == kNoToken) return MalformedReason::missingCategory;
+  for (size_t slot = 0; slot < kRequiredFields; ++slot) {
+    if (point_.tokens[slot] == kNoToken) return kJournalFields[slot].whenMissing;
+  }
   if (point_.attributes.size() > kMaxAttributes) return MalformedReason::tooManyAttributes;
   return std::nullopt;
 }
@@ -111,6 +114,7 @@ void IntervalAssembler::emitEvent() {
                     table_.text(point_[FieldKind::category]))) {
     return;
   }
+  // An event lasts no time unless it states a duration.
   sink_.deliverEvent(
       std::make_shared<const TesselEvent>(fieldsOf(point_.tokens, 0), processOf(point_.tokens)));
 }
@@ -128,6 +132,9 @@ void IntervalAssembler::end(const EntryHeader& header) {
     return;
   }
   ++counts_.pairedEnds;
+  // `begin` stays valid up to close(): a sink sees objects alone and cannot open an interval.
+  // An end that claims an earlier time than its begin gets a negative duration. The filter counts
+  // those; to leave them out here would hide them.
   const auto microseconds = static_cast<int64_t>(header.monotonic - begin->monotonic);
   const auto seconds = static_cast<float>(static_cast<double>(microseconds) / 1e6);
   if (sink_.admits(table_.text(begin->key.subsystem), table_.text(begin->key.category))) {
@@ -136,6 +143,8 @@ void IntervalAssembler::end(const EntryHeader& header) {
   open_.close(begin);
 }
 
+// Where both ends state a field, the end counts, because it knew how things went. Only telemetry is
+// on when either end says so: a writer marks an interval at one end. Each end keeps its process.
 void IntervalAssembler::deliverMerged(const PointTokens& begin,
                                       const std::vector<FieldToken>& beginAttributes,
                                       float measuredSeconds) {
@@ -159,6 +168,9 @@ void IntervalAssembler::deliverMerged(const PointTokens& begin,
   }
 }
 
+// Ends of two boots never match, because the monotonic time starts anew with each boot and the
+// distance between the two would mean nothing. Ends of two processes match in system scope alone,
+// because two processes may well use the same ids.
 IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
   const bool system = table_.flag(point_[FieldKind::scope]);
   return {table_.identity(point_[FieldKind::intervalId]),
@@ -169,6 +181,8 @@ IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
           system ? IntervalKey::kSystemScope : point_[FieldKind::process]};
 }
 
+// A duration that the writer states counts before the measured one: it may time something else than
+// the moments at which it wrote.
 TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
                                              float measuredSeconds) const {
   const auto text = [&](FieldKind kind) { return table_.text(tokenOf(tokens, kind)); };
@@ -180,12 +194,12 @@ TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
   fields.category = text(FieldKind::category);
   fields.name = text(FieldKind::name);
   for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
-    fields.strings[slot] = {text(inSlot(FieldKind::string1Name, slot)),
-                            text(inSlot(FieldKind::string1Value, slot))};
+    fields.strings[slot] = {text(labelled(FieldKind::string1Name, slot)),
+                            text(labelled(FieldKind::string1Value, slot))};
   }
   for (size_t slot = 0; slot < kLabelledNumbers; ++slot) {
-    fields.numbers[slot] = {text(inSlot(FieldKind::number1Name, slot)),
-                            number(inSlot(FieldKind::number1Value, slot))};
+    fields.numbers[slot] = {text(labelled(FieldKind::number1Name, slot)),
+                            number(labelled(FieldKind::number1Value, slot))};
   }
   fields.durationSeconds = duration == kNoToken ? measuredSeconds : table_.real(duration);
   fields.telemetryEnabled = table_.flag(tokenOf(tokens, FieldKind::telemetry));
@@ -197,7 +211,8 @@ EmittingProcess IntervalAssembler::processOf(const PointTokens& tokens) const {
           table_.text(tokenOf(tokens, FieldKind::processName))};
 }
 
-// Adds the attributes whose key is not there yet.
+// Adds the attributes whose key is not there yet. Keys are interned in one pool, so equal keys have
+// one record. Comparing each with all others is quick enough for the 32 that an entry may have.
 void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
                                          IntervalFields& interval) const {
   for (const FieldToken token : tokens) {
@@ -209,6 +224,8 @@ void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
   }
 }
 
+// The key of an interval consists of tokens, so it changes with them. Two keys that differ stay
+// different, because equal values have equal tokens in the new generation too.
 void IntervalAssembler::startGeneration() {
   TracePointTable::Renewal renewal = table_.startGeneration();
   open_.renewAll([&](OpenInterval& interval) {

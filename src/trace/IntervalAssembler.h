@@ -1,11 +1,12 @@
 // IntervalAssembler: from the tokens of entries to trace objects.
 //
-// Events are delivered as they come, intervals when their end comes. Begin and end match on boot,
-// subsystem, category, name, id and, in process scope, process; a second begin replaces the first,
-// an end without a begin is counted. Every field that the end lacks is taken from the begin, and
-// telemetry is on when either says so. With a frame rate on either end it is an animation interval.
+// An event is delivered when it is read, an interval when its end is read. A begin and an end match
+// when boot, subsystem, category, name and id are equal, and in process scope the process too. A
+// second begin under the same key replaces the first. An end without a begin is counted. A field
+// that the end lacks is taken from the begin; telemetry is on when either says so. An interval with
+// a frame rate on either end is an animation interval.
 //
-// Nothing here looks at text: pairing compares tokens, objects borrow interned strings.
+// Nothing here looks at text. Pairing compares tokens, and objects borrow interned strings.
 //
 // Threads: one at a time.
 
@@ -21,9 +22,6 @@
 #include "trace/TracePointTable.h"
 
 namespace tessel {
-
-// Attributes that one entry may carry.
-inline constexpr size_t kMaxAttributes = 32;
 
 // Where assembled objects go.
 class TraceObjectSink {

@@ -1,3 +1,5 @@
+// The reading loop, the books of a run, and the limit on pairs.
+
 #include "trace/JournalExtractor.h"
 
 #include <algorithm>
@@ -11,8 +13,8 @@ namespace tessel {
 
 namespace {
 
-// Progress is told to the service manager's watchdog. A few thousand entries take milliseconds, so
-// asking more often would only cost time.
+// Reading so many entries takes milliseconds. That is often enough for any watchdog and seldom
+// enough to cost nothing.
 constexpr uint64_t kEntriesPerStep = 4096;
 
 // Dates before 1970 are before every entry.
@@ -20,8 +22,9 @@ uint64_t microsecondsSince1970(Date date) {
   return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
 }
 
-// The books of the run. Every trace point is an event, a begin or an end, and each of these came to
-// exactly one of its fates; every event and every pair was delivered or refused.
+// The books of the run. Every trace point is an event, a begin or an end. A begin met its end, was
+// replaced, was dropped or still waits; an end met its begin or did not. Every event and every pair
+// was delivered, or refused because of the limit on pairs. A summary over other books would lie.
 void checkBooks(const ExtractionReport& report) {
   const AssemblyCounts& counts = report.assembly;
   const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
@@ -43,6 +46,25 @@ void logLosses(const Losses& losses) {
 
 }  // namespace
 
+bool PairLimit::admits(StringRef subsystem, StringRef category) {
+  const Pair pair{subsystem.hash(), category.hash()};
+  // Both hashes are seeded, so the sum needs no seed. The odd factor keeps pairs of two equal
+  // texts, and pairs whose texts change places, apart.
+  const auto hash = static_cast<uint32_t>(pair.subsystem + pair.category * 0x9e3779b97f4a7c15u);
+  const auto isPair = [&](uint32_t number) { return pairs_[number] == pair; };
+  // Nearly every object has a pair that was let in long ago.
+  if (index_.find(hash, isPair) != FlatIndex::kNone) return true;
+  const size_t text = subsystem.textOr("").size() + category.textOr("").size();
+  if (pairs_.size() >= limits_.pairs || textBytes_ + text > limits_.textBytes) {
+    ++refusals_;
+    return false;
+  }
+  index_.add(hash, static_cast<uint32_t>(pairs_.size()));
+  pairs_.push_back(pair);
+  textBytes_ += text;
+  return true;
+}
+
 JournalExtractor::JournalExtractor(std::optional<std::string> systemStore,
                                    const ExtractionLimits& limits)
     : systemStore_(std::move(systemStore)),
@@ -63,10 +85,7 @@ void JournalExtractor::setEmitEventProcessingBlock(EventCallback callback) {
   event_ = std::move(callback);
 }
 
-void JournalExtractor::setBuildAnimationCompositeIntervalTimelines(bool build) {
-  buildCompositeTimelines_ = build;
-}
-
+// No data is handed over with the flag, so its store needs no order with others.
 void JournalExtractor::stopProcessing() { stop_.store(true, std::memory_order_relaxed); }
 
 bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string>& path,
@@ -89,6 +108,8 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
   return true;
 }
 
+// The flag is looked at before each entry and never within one, so an entry that was begun has all
+// its consequences and the books balance at whatever place a stop ends the loop.
 void JournalExtractor::processEntries(EntryStream& entries) {
   while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
     if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
@@ -123,6 +144,7 @@ bool JournalExtractor::admits(StringRef subsystem, StringRef category) {
   return pairs_.admits(subsystem, category);
 }
 
+// Counted before the call: a callback that answers false has had its object too.
 template <typename Callback, typename Object>
 void JournalExtractor::deliver(const Callback& callback, const Object& object) {
   ++report_.delivered;

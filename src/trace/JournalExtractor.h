@@ -1,8 +1,13 @@
 // JournalExtractor: the trace-extraction service over a trace store.
 //
-// Reads the store once, entry by entry on the calling thread, and calls back in between. A callback
-// that answers false ends the processing call as a stop does. An extractor that was stopped stays
-// stopped.
+// It stands on top of this folder. TracePointFields says which journal fields a trace point has.
+// TracePointTable turns each FIELD=value of a store into a token. OpenIntervals keeps the begins
+// that wait, IntervalAssembler pairs them with their ends and makes the objects, and this class
+// reads the store and delivers them.
+//
+// It reads the store once, entry by entry on the calling thread, and calls back in between. A
+// callback that answers false ends the processing call as a stop does. An extractor that was
+// stopped stays stopped.
 //
 // Threads: stopProcessing() may come from any thread at any time; everything else belongs to the
 // thread of the run.
@@ -11,16 +16,52 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "journal/EntryStream.h"
 #include "journal/StoreReport.h"
 #include "objects/TesselSupportObjectExtractor.h"
+#include "platform/FlatIndex.h"
 #include "platform/System.h"
 #include "trace/IntervalAssembler.h"
-#include "trace/PairLimit.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel {
+
+// What a run does for each (subsystem, category) pair at its end takes time and memory, and a
+// writer may make up as many pairs as it likes. 4,096 is more than a machine full of programs has;
+// 4 MiB of text give each of them names of 1 KiB.
+struct PairLimits {
+  size_t pairs = 4096;
+  size_t textBytes = size_t{4} * 1024 * 1024;  // of all subsystems and categories together
+};
+
+// Lets in so many distinct pairs and refuses the others. A pair is known by its two seeded 64-bit
+// hashes, so that no text is kept; that two pairs ever meet in both is out of reach of any writer.
+class PairLimit {
+ public:
+  explicit PairLimit(PairLimits limits = {}) : limits_(limits) {}
+
+  // Whether the pair is among those that were let in, or there is room to let it in. Counts each
+  // refusal.
+  bool admits(StringRef subsystem, StringRef category);
+  size_t pairs() const { return pairs_.size(); }
+  uint64_t refusals() const { return refusals_; }
+
+ private:
+  struct Pair {
+    uint64_t subsystem = 0;
+    uint64_t category = 0;
+
+    bool operator==(const Pair&) const = default;
+  };
+
+  const PairLimits limits_;
+  std::vector<Pair> pairs_;  // those that were let in
+  FlatIndex index_;          // of pairs_
+  size_t textBytes_ = 0;
+  uint64_t refusals_ = 0;
+};
 
 struct ExtractionLimits {
   TracePointTableLimits table;
@@ -49,8 +90,8 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;
   void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
   void setEmitEventProcessingBlock(EventCallback callback) override;
-  // Composite timelines are not built; the option is kept for the interface's sake.
-  void setBuildAnimationCompositeIntervalTimelines(bool build) override;
+  // This extractor builds no composite timelines, so either answer changes nothing.
+  void setBuildAnimationCompositeIntervalTimelines(bool) override {}
   bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
                                  Date endDate, std::optional<PlatformError>& errorOut) override;
   void stopProcessing() override;
@@ -90,7 +131,6 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   IntervalCallback interval_;
   AnimationIntervalCallback animationInterval_;
   EventCallback event_;
-  bool buildCompositeTimelines_ = false;
   ServiceStatus* status_ = nullptr;
 
   const EntryHeader* current_ = nullptr;  // while an entry is looked at

@@ -32,6 +32,8 @@ const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
   return number == kNone ? nullptr : &nodes_[number];
 }
 
+// The interval that is replaced goes before the new one comes: the new one then stands at the young
+// end of the list, and the attributes of the old one do not count against it.
 bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
                          const std::vector<FieldToken>& attributes) {
   const uint32_t hash = hashOf(key);
@@ -47,7 +49,8 @@ bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const Point
   node.hash = hash;
   link(number);
   index_.add(hash, number);
-  // One interval alone may stay: what an entry may carry is bounded far below the limit.
+  // The last interval stays whatever it carries. An entry has at most 32 attributes, so only a
+  // limit below that, as tests set it, could ask for more.
   while (size_ > limits_.intervals || (attributes_ > limits_.attributes && size_ > 1)) {
     remove(oldest_);
     ++dropped_;
@@ -55,11 +58,13 @@ bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const Point
   return replaced != kNone;
 }
 
+// The place in the slab is the number, so closing needs no second search by key.
 void OpenIntervals::close(const OpenInterval* interval) {
   remove(static_cast<uint32_t>(static_cast<const Node*>(interval) - nodes_.data()));
 }
 
-// Nodes are used again before the slab grows, so it never has more than were open at once.
+// Free nodes are used first, so the slab never has more nodes than intervals were open at once. The
+// free ones are a list through `older`, which takes no memory of its own.
 uint32_t OpenIntervals::newNode() {
   if (free_ == kNone) {
     nodes_.emplace_back();
@@ -89,11 +94,13 @@ void OpenIntervals::release(uint32_t number) {
   (node.older == kNone ? oldest_ : nodes_[node.older].younger) = node.younger;
   (node.younger == kNone ? youngest_ : nodes_[node.younger].older) = node.older;
   attributes_ -= node.attributes.size();
-  node.attributes = std::vector<FieldToken>();  // gives its memory back
+  node.attributes = std::vector<FieldToken>();  // clear() would keep the memory of each free node
   node.older = std::exchange(free_, number);
   --size_;
 }
 
+// The hash of a key comes from its tokens, so the index is made anew. It goes from the youngest to
+// the oldest, because those that find no room are to be the oldest, as with the other limits.
 void OpenIntervals::renewAll(const std::function<bool(OpenInterval&)>& renew) {
   index_.clear();
   uint32_t at = youngest_;

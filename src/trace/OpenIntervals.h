@@ -5,6 +5,9 @@
 // A begin that replaces another counts as the youngest, for the same reason: its end is due from
 // now on. The memory is that of as many begins as were ever open at once.
 //
+// Intervals hold tokens, from one entry to the next and over a change of generation: see
+// renewAll().
+//
 // Threads: one at a time.
 
 #pragma once
@@ -23,8 +26,9 @@ namespace tessel {
 
 using PointTokens = std::array<FieldToken, kPointSlots>;
 
-// What begin and end match on. `process` is the process's token, or kSystemScope.
+// A begin and an end belong together where these are equal.
 struct IntervalKey {
+  // Stands for the process of an interval whose ends may come from two. No token has this value.
   static constexpr FieldToken kSystemScope = ~FieldToken{0};
 
   uint64_t id;  // TracePointTable::identity() of its token
@@ -32,7 +36,7 @@ struct IntervalKey {
   FieldToken subsystem;
   FieldToken category;
   FieldToken name;
-  FieldToken process;
+  FieldToken process;  // or kSystemScope
 
   bool operator==(const IntervalKey&) const = default;
 };
@@ -69,7 +73,7 @@ class OpenIntervals {
   void renewAll(const std::function<bool(OpenInterval&)>& renew);
 
   size_t size() const { return size_; }
-  // How many gave way to younger ones.
+  // How many were dropped because of the limits, or because they found no room when renewed.
   uint64_t dropped() const { return dropped_; }
 
  private:

@@ -1,17 +1,29 @@
-// What the fields of a trace point are called, and why an entry may be no good.
+// The journal fields of a trace point: one row for each says what it is called, which values it may
+// have, and what is wrong with an entry that lacks it or has a bad one. Whoever reads or writes
+// trace points takes that from here.
+//
+// A new field is a kind and a row here, and its use in IntervalAssembler.cpp.
+//
+// Any thread.
 
 #pragma once
 
+#include <algorithm>
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <iterator>
 #include <optional>
+#include <span>
 #include <string_view>
+
+#include "journal/EntryStream.h"
+#include "platform/Values.h"
 
 namespace tessel {
 
-// Kinds of field values. Those below `attribute` stand at most once in a trace point and have a
-// slot in it; the order puts what a writer says before what the journal daemon adds.
+// What a token can stand for. The kinds below `attribute` stand at most once in a trace point and
+// have a slot in it. Required ones come first, so that one comparison tells them.
 enum class FieldKind : uint8_t {
   pointKind,
   subsystem,
@@ -20,6 +32,7 @@ enum class FieldKind : uint8_t {
   intervalId,
   scope,
   telemetry,
+  // Of the labelled arguments: label, value, label, value, as labelled() counts.
   string1Name,
   string1Value,
   string2Name,
@@ -34,14 +47,28 @@ enum class FieldKind : uint8_t {
   processName,
   process,
   attribute,
+  // No journal fields: a bad value of any field, and the boot that the entry's header names.
   malformed,
   boot,
 };
 inline constexpr size_t kPointSlots = static_cast<size_t>(FieldKind::attribute);
 
-enum class PointKind : uint8_t { event, begin, end };
+// The kind that `ofFirst`, such as string1Value, has for the labelled argument of another index.
+constexpr FieldKind labelled(FieldKind ofFirst, size_t index) {
+  return static_cast<FieldKind>(static_cast<size_t>(ofFirst) + 2 * index);
+}
 
-// Why an entry that means to be a trace point is not taken as one.
+// In the order of the words.
+enum class PointKind : uint8_t { event, begin, end };
+inline constexpr std::string_view kPointKindWords[] = {"event", "begin", "end"};
+// The second is the one that pairs across processes.
+inline constexpr std::string_view kScopeWords[] = {"process", "system"};
+
+// Attributes that one entry may carry. An interval compares each with all others, so their number
+// bounds the time that one entry can take.
+inline constexpr size_t kMaxAttributes = 32;
+
+// Why an entry that means to be a trace point is not taken as one. Reports list them in this order.
 enum class MalformedReason : uint8_t {
   unknownKind,
   unknownScope,
@@ -54,15 +81,106 @@ enum class MalformedReason : uint8_t {
   missingSubsystem,
   missingCategory,
 };
-inline constexpr size_t kMalformedReasons = 10;
+inline constexpr std::string_view kMalformedReasonTexts[] = {
+    "unknown TESSEL_KIND",
+    "unknown TESSEL_INTERVAL_SCOPE",
+    "TESSEL_DURATION is no number",
+    "TESSEL_FRAME_RATE is no number",
+    "TESSEL_ATTRIBUTE is not KEY=VALUE",
+    "value over 4096 bytes",
+    "more than 32 TESSEL_ATTRIBUTE",
+    "missing TESSEL_KIND",
+    "missing TESSEL_SUBSYSTEM",
+    "missing TESSEL_CATEGORY",
+};
+inline constexpr size_t kMalformedReasons = std::size(kMalformedReasonTexts);
+static_assert(kMalformedReasons == static_cast<size_t>(MalformedReason::missingCategory) + 1);
+static_assert(kMaxFieldValueLength == 4096 && kMaxAttributes == 32);  // as the texts say
+
+constexpr std::string_view malformedReasonText(MalformedReason reason) {
+  return kMalformedReasonTexts[static_cast<size_t>(reason)];
+}
+
+// Which values a field may have.
+enum class ValueForm : uint8_t {
+  text,
+  identifier,  // a text that only pairing looks at
+  word,        // one of a few words; any other is bad
+  flag,        // "1" is yes, any other text is no
+  real,        // a decimal that a 32-bit float can hold; any other text is bad
+  number,      // a decimal; with any other text the field counts as absent
+  process,     // a number that pairing compares
+  attribute,   // KEY=VALUE with a key; any other text is bad
+};
+
+struct JournalField {
+  FieldKind kind;
+  std::string_view name;
+  ValueForm form = ValueForm::text;
+  std::optional<MalformedReason> whenBad = {};
+  std::optional<MalformedReason> whenMissing = {};  // set: no trace point goes without the field
+  std::span<const std::string_view> words = {};
+};
+
+// One row for each kind, in the order of the kinds.
+inline constexpr JournalField kJournalFields[] = {
+    {FieldKind::pointKind, "TESSEL_KIND", ValueForm::word, MalformedReason::unknownKind,
+     MalformedReason::missingKind, kPointKindWords},
+    {FieldKind::subsystem,
+     "TESSEL_SUBSYSTEM",
+     ValueForm::text,
+     {},
+     MalformedReason::missingSubsystem},
+    {FieldKind::category, "TESSEL_CATEGORY", ValueForm::text, {}, MalformedReason::missingCategory},
+    {FieldKind::name, "TESSEL_NAME"},
+    {FieldKind::intervalId, "TESSEL_INTERVAL_ID", ValueForm::identifier},
+    {FieldKind::scope,
+     "TESSEL_INTERVAL_SCOPE",
+     ValueForm::word,
+     MalformedReason::unknownScope,
+     {},
+     kScopeWords},
+    {FieldKind::telemetry, "TESSEL_TELEMETRY", ValueForm::flag},
+    {FieldKind::string1Name, "TESSEL_STRING1_NAME"},
+    {FieldKind::string1Value, "TESSEL_STRING1_VALUE"},
+    {FieldKind::string2Name, "TESSEL_STRING2_NAME"},
+    {FieldKind::string2Value, "TESSEL_STRING2_VALUE"},
+    {FieldKind::number1Name, "TESSEL_NUMBER1_NAME"},
+    {FieldKind::number1Value, "TESSEL_NUMBER1_VALUE", ValueForm::number},
+    {FieldKind::number2Name, "TESSEL_NUMBER2_NAME"},
+    {FieldKind::number2Value, "TESSEL_NUMBER2_VALUE", ValueForm::number},
+    {FieldKind::duration, "TESSEL_DURATION", ValueForm::real, MalformedReason::invalidDuration},
+    {FieldKind::frameRate, "TESSEL_FRAME_RATE", ValueForm::real, MalformedReason::invalidFrameRate},
+    {FieldKind::imagePath, "_EXE"},
+    {FieldKind::processName, "_COMM"},
+    {FieldKind::process, "_PID", ValueForm::process},
+    {FieldKind::attribute, "TESSEL_ATTRIBUTE", ValueForm::attribute,
+     MalformedReason::invalidAttribute},
+};
+static_assert(std::size(kJournalFields) == kPointSlots + 1);
+static_assert(std::ranges::all_of(kJournalFields, [](const JournalField& field) {
+  return &field == &kJournalFields[static_cast<size_t>(field.kind)];
+}));
+
+// REQUIRES: `kind` is that of a journal field.
+constexpr const JournalField& journalField(FieldKind kind) {
+  return kJournalFields[static_cast<size_t>(kind)];
+}
+// The field called `name`; null for a field that no trace point has.
+const JournalField* journalFieldNamed(std::string_view name);
 
 // Whether every trace point has a field of this kind.
-constexpr bool isRequired(FieldKind kind) { return kind <= FieldKind::category; }
+inline constexpr size_t kRequiredFields =
+    std::ranges::count_if(kJournalFields, [](const auto& field) { return !!field.whenMissing; });
+static_assert(std::ranges::is_partitioned(kJournalFields,
+                                          [](const auto& field) { return !!field.whenMissing; }));
+constexpr bool isRequired(FieldKind kind) { return static_cast<size_t>(kind) < kRequiredFields; }
 
-// In words, such as "unknown TESSEL_KIND".
-std::string_view malformedReasonText(MalformedReason reason);
+// An integer that fits 64 bits stays one, signed where it fits both; another finite decimal is a
+// double. Nothing for any other text, such as one with a space or a plus sign.
+std::optional<Number> parseDecimal(std::string_view text);
 
-// The kind of the field called `name`; nothing for a field that no trace point has.
-std::optional<FieldKind> fieldKindOf(std::string_view name);
+// A finite decimal within the range of a 32-bit float.
+std::optional<float> parseFloat(std::string_view text);
 
 }  // namespace tessel

@@ -30,7 +30,7 @@ namespace tessel {
 // ordinary day fit several times over. While a generation is replaced, the old one and at most half
 // of a new one are in memory together, so the whole stays near 20 MiB.
 struct TracePointTableLimits {
-  size_t fields = size_t{512} * 1024;          // distinct values; at most 16 million
+  size_t fields = size_t{512} * 1024;          // distinct values; at most 15 million
   size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
 };
 
@@ -45,24 +45,23 @@ class TracePointTable final : public FieldTokenizer {
 
   FieldToken bootToken(const Id128& boot);
 
-  // The value of a token of this generation; what `kNoToken` stands for is absent.
+  // The functions from here on answer the value of a token of this generation. A token is only good
+  // for those that suit its kind; kNoToken is good for all, and its value is absent.
   static FieldKind kind(FieldToken token) { return FieldKind(token >> kIndexBits); }
-  // Equal for equal values of one kind; 0 for what is absent.
+  // Equal for equal values of one kind; 0 for an absent value.
   uint64_t identity(FieldToken token) const { return at(token).identity(); }
   StringRef text(FieldToken token) const { return StringRef(at(token).record); }
   std::optional<Number> number(FieldToken token) const;
-  // REQUIRES: the token is one of a duration or a frame rate.
   float real(FieldToken token) const { return at(token).real; }
-  // REQUIRES: the token is one of a point kind; of a scope or the telemetry flag; of what is
-  // malformed.
   PointKind pointKind(FieldToken token) const;
-  bool flag(FieldToken token) const { return token != kNoToken && at(token).whole != 0; }
+  // Of the telemetry flag; of a scope, whether it is "system".
+  bool flag(FieldToken token) const { return at(token).whole != 0; }
   MalformedReason malformedReason(FieldToken token) const;
-  // Whether what is malformed is a field that every trace point has.
+  // Whether the bad field is one that every trace point has.
   bool malformedIsRequired(FieldToken token) const {
     return (at(token).whole & kMalformedRequired) != 0;
   }
-  // REQUIRES: the token is one of an attribute.
+  // Key and value. REQUIRES: the token is not kNoToken.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {
     return contents_.attributes[at(token).whole];
   }
@@ -88,7 +87,7 @@ class TracePointTable final : public FieldTokenizer {
     FieldKind kind = FieldKind::malformed;
     Form form = Form::none;
 
-    // A text is interned, so its record stands for it.
+    // Two equal texts have one record, so its address stands for the text.
     uint64_t identity() const {
       return form == Form::text ? reinterpret_cast<uintptr_t>(record) : whole;
     }
@@ -100,21 +99,22 @@ class TracePointTable final : public FieldTokenizer {
     FlatIndex index;  // of the tokens of fields that are found again by value
   };
 
-  // Beside the reason in the value of what is malformed.
+  // A malformed value is its reason, with this bit where the bad field is a required one.
   static constexpr uint64_t kMalformedRequired = 0x100;
-  // Below the kind in a token. The kinds leave the tokens of the store itself free.
+  static_assert(kMalformedReasons <= kMalformedRequired);
+  // 24 bits number 16 million values, 32 times the limit. That leaves 8 bits for the kind, of which
+  // the highest is 0: the tokens with that bit belong to the store itself.
   static constexpr int kIndexBits = 24;
   static_assert(FieldToken(FieldKind::boot) < kFirstReservedToken >> kIndexBits);
 
   static size_t indexOf(FieldToken token) { return token & ((1u << kIndexBits) - 1); }
   const Field& at(FieldToken token) const { return contents_.fields[indexOf(token)]; }
   static Field wholeField(FieldKind kind, uint64_t value);
-  static Field malformedField(FieldKind kind, MalformedReason reason);
   static Contents emptyContents(const TracePointTableLimits& limits);
-  FieldToken parse(FieldKind kind, std::string_view value);
-  FieldToken parseNumber(FieldKind kind, std::string_view value);
-  FieldToken parseId(std::string_view value);
-  FieldToken parseAttribute(std::string_view value);
+  FieldToken malformedToken(FieldKind kind, MalformedReason reason);
+  FieldToken parse(const JournalField& field, std::string_view value);
+  FieldToken parseNumber(const JournalField& field, std::string_view value);
+  FieldToken parseIdentifier(FieldKind kind, std::string_view value);
   FieldToken addAttribute(std::string_view key, std::string_view value);
   FieldToken textToken(FieldKind kind, std::string_view value);
   FieldToken add(const Field& field);

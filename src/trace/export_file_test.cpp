@@ -71,7 +71,7 @@ TEST_F(ExportFileTest, writersDoNotMixTheirEntries) {
   EXPECT_TRUE(report.problems.empty());
 }
 
-TEST_F(ExportFileTest, halfAnEntryOfAnotherWriterCostsThatEntry) {
+TEST_F(ExportFileTest, halfAnEntryCostsNoOther) {
   ASSERT_TRUE(append("first"));
   std::ofstream(path(), std::ios::app) << "__REALTIME_TIMESTAMP=1\nTESSEL_NA";
   ASSERT_TRUE(append("second"));

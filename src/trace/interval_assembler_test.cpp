@@ -219,14 +219,14 @@ TEST_F(IntervalAssemblerTest, theEndWinsAndTheBeginFillsIn) {
   for (const PairingCase& c : cases) EXPECT_EQ(run(c.points), c.delivered) << c.what;
 }
 
-TEST_F(IntervalAssemblerTest, theMeasuredDurationIsTheEndsTimeLessTheBegins) {
+TEST_F(IntervalAssemblerTest, durationIsEndLessBegin) {
   EXPECT_THAT(runEntries({tracePoint("begin", 5'000'000), tracePoint("end", 5'000'001)}),
               ElementsAre("Interval com.vantor.Calendar/View 1e-06s"));
   EXPECT_THAT(runEntries({tracePoint("begin", 5'000'000), tracePoint("end", 4'000'000)}),
               ElementsAre("Interval com.vantor.Calendar/View -1s"));
 }
 
-TEST_F(IntervalAssemblerTest, malformedEntriesAreCountedByReason) {
+TEST_F(IntervalAssemblerTest, malformedIsCountedByReason) {
   const std::string atCap(4096, 'x');
   const struct {
     Lines fields;
@@ -267,7 +267,7 @@ TEST_F(IntervalAssemblerTest, malformedEntriesAreCountedByReason) {
   }
 }
 
-TEST_F(IntervalAssemblerTest, tooManyAttributesAreMalformed) {
+TEST_F(IntervalAssemblerTest, manyAttributesAreMalformed) {
   std::string point = "begin";
   for (int i = 0; i < 32; ++i) point += "|ATTRIBUTE=k" + std::to_string(i) + "=v";
   EXPECT_EQ(run({point, "end"}).size(), 1u);
@@ -285,7 +285,7 @@ TEST_F(IntervalAssemblerTest, theOldestOpenIntervalGoes) {
   EXPECT_EQ(run({"end|INTERVAL_ID=1", "end|INTERVAL_ID=3", "end|INTERVAL_ID=4"}).size(), 3u);
 }
 
-TEST_F(IntervalAssemblerTest, attributesOfOpenIntervalsAreBounded) {
+TEST_F(IntervalAssemblerTest, openAttributesAreBounded) {
   openLimits.attributes = 3;
   run({"begin|INTERVAL_ID=1|ATTRIBUTE=a=1|ATTRIBUTE=b=2",
        "begin|INTERVAL_ID=2|ATTRIBUTE=a=1|ATTRIBUTE=b=2"});
@@ -297,7 +297,7 @@ TEST_F(IntervalAssemblerTest, attributesOfOpenIntervalsAreBounded) {
   EXPECT_EQ(assembler().counts().droppedOpenIntervals, 2u);
 }
 
-TEST_F(IntervalAssemblerTest, openIntervalsOutliveTheTablesGeneration) {
+TEST_F(IntervalAssemblerTest, intervalsOutliveAGeneration) {
   tableLimits.fields = 200;
   run(
       {"begin|INTERVAL_ID=x|NAME=Open|STRING1_VALUE=week|NUMBER1_VALUE=18446744073709551615|"
@@ -313,7 +313,7 @@ TEST_F(IntervalAssemblerTest, openIntervalsOutliveTheTablesGeneration) {
   EXPECT_EQ(assembler().counts().droppedOpenIntervals, 0u);
 }
 
-TEST_F(IntervalAssemblerTest, whatOpenIntervalsHoldIsBoundedToo) {
+TEST_F(IntervalAssemblerTest, textOfIntervalsIsBounded) {
   tableLimits.textBytes = 64 * 1024;
   size_t opened = 0;
   for (; table().generation() < 4; ++opened) {
@@ -328,7 +328,7 @@ TEST_F(IntervalAssemblerTest, whatOpenIntervalsHoldIsBoundedToo) {
   EXPECT_THAT(run({"end|INTERVAL_ID=0"}), IsEmpty());
 }
 
-TEST_F(IntervalAssemblerTest, deliveredObjectsKeepTheirStrings) {
+TEST_F(IntervalAssemblerTest, objectsKeepTheirStrings) {
   tableLimits.fields = 64;
   keepObjects = true;
   for (int i = 0; i < 200; ++i) run({"event|STRING1_VALUE=" + std::to_string(i)});
@@ -338,7 +338,7 @@ TEST_F(IntervalAssemblerTest, deliveredObjectsKeepTheirStrings) {
   }
 }
 
-TEST_F(IntervalAssemblerTest, manyIntervalsOpenAndCloseInAnyOrder) {
+TEST_F(IntervalAssemblerTest, intervalsCloseInAnyOrder) {
   openLimits.intervals = 5000;
   const int count = 5000;
   for (int i = 0; i < count; ++i) run({"begin|INTERVAL_ID=" + std::to_string(i)});

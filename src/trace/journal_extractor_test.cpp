@@ -62,7 +62,7 @@ class JournalExtractorTest : public ::testing::Test {
   std::unique_ptr<JournalExtractor> extractor_;
 };
 
-TEST_F(JournalExtractorTest, eachKindGoesToItsOwnCallbackAndEveryEntryCounts) {
+TEST_F(JournalExtractorTest, eachKindHasItsCallback) {
   process({{{"MESSAGE=a log event"}, {}},
            tracePoint("event"),
            tracePoint("begin"),
@@ -90,7 +90,7 @@ TEST_F(JournalExtractorTest, aStreamThatGrewIsTakenUpAgain) {
   EXPECT_EQ(extractor().processedEventCount(), 2u);
 }
 
-TEST_F(JournalExtractorTest, theCurrentEntryIsThatOfTheObject) {
+TEST_F(JournalExtractorTest, currentEntryIsTheObjects) {
   std::vector<FakeEntry> entries = {tracePoint("begin"), tracePoint("end"), tracePoint("event")};
   for (size_t i = 0; i < entries.size(); ++i) entries[i].header.sequenceNumber = i;
   std::vector<uint64_t> numbers;
@@ -102,7 +102,7 @@ TEST_F(JournalExtractorTest, theCurrentEntryIsThatOfTheObject) {
   EXPECT_THAT(numbers, ElementsAre(1, 2));
 }
 
-TEST_F(JournalExtractorTest, pairsBeyondTheLimitAreNotDelivered) {
+TEST_F(JournalExtractorTest, pairsOverTheLimitAreRefused) {
   limits.pairs.pairs = 2;
   process({tracePoint("event|CATEGORY=a"), tracePoint("event|CATEGORY=b"),
            tracePoint("event|CATEGORY=c"), tracePoint("begin|CATEGORY=c"),
@@ -122,7 +122,7 @@ TEST_F(JournalExtractorTest, theTextOfPairsIsLimitedToo) {
   EXPECT_EQ(delivered.size(), 2u);
 }
 
-TEST_F(JournalExtractorTest, aStopBeforehandMakesTheCallReturnAtOnce) {
+TEST_F(JournalExtractorTest, anEarlyStopReturnsAtOnce) {
   extractor().stopProcessing();
   std::optional<PlatformError> error;
   EXPECT_TRUE(extractor().processLogArchiveWithPath("/nowhere", Date{}, Date::max(), error));
@@ -154,7 +154,7 @@ class EndlessStream final : public EntryStream {
   EntryHeader header_;
 };
 
-TEST_F(JournalExtractorTest, aStopTakesEffectWhereNothingIsDelivered) {
+TEST_F(JournalExtractorTest, aStopNeedsNoDelivery) {
   EndlessStream stream;
   JournalExtractor& running = extractor();  // made before there are two threads
   std::thread stopper([&] { running.stopProcessing(); });
@@ -163,7 +163,7 @@ TEST_F(JournalExtractorTest, aStopTakesEffectWhereNothingIsDelivered) {
   EXPECT_TRUE(running.report().stopped);
 }
 
-TEST_F(JournalExtractorTest, aStoreOnDiskIsReadWithinTheRange) {
+TEST_F(JournalExtractorTest, aStoreIsReadWithinItsRange) {
   const testing::TemporaryDirectory store;
   RecordOrigin origin = currentOrigin();
   for (const uint64_t time : {99u, 100u, 199u, 200u}) {

@@ -15,6 +15,7 @@
 #include "os/Files.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/commands/RecordedPoint.h"
+#include "trace/TracePointFields.h"
 
 extern char** environ;
 
@@ -201,7 +202,8 @@ void addPointOptions(CLI::App& app, RecordedPoint& point) {
   app.add_option("--id", point.id, "Which begin an end belongs to, where several are open")
       ->type_name("ID");
   app.add_option("--scope", point.scope, "Whether begin and end come from one process")
-      ->check(CLI::IsMember({"process", "system"}));
+      ->check(
+          CLI::IsMember(std::vector<std::string>(std::begin(kScopeWords), std::end(kScopeWords))));
   app.add_option("--attribute", point.attributes, "Attribute of an interval; may be repeated")
       ->type_name("KEY=VALUE")
       ->allow_extra_args(false);

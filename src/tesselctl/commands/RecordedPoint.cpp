@@ -6,8 +6,7 @@
 #include <algorithm>
 
 #include "journal/EntryStream.h"
-#include "trace/DecimalNumber.h"
-#include "trace/IntervalAssembler.h"
+#include "trace/TracePointTable.h"
 
 namespace tessel::ctl {
 
@@ -29,40 +28,34 @@ class FieldList {
     }
     fields_.push_back({name, value});
   }
-  void add(const std::string& name, const std::optional<std::string>& value) {
-    if (value) add(name, *value);
+  // A field of trace points. The reader of the journal says whether it would take the value, so
+  // what is recorded and what is read cannot come apart.
+  void add(FieldKind kind, const std::optional<std::string>& value) {
+    if (!value) return;
+    const JournalField& field = journalField(kind);
+    add(std::string(field.name), *value);
+    const FieldToken token = reader_.tokenFor(field.name, *value, value->size());
+    if (token != kNoToken && TracePointTable::kind(token) != FieldKind::malformed) return;
+    complain("'" + *value + "' is " +
+             (field.form == ValueForm::attribute ? "not KEY=VALUE" : "no decimal number"));
   }
-  // Each LABEL=VALUE as the two fields of its slot, such as TESSEL_STRING1_NAME and ..._VALUE.
+  // Each LABEL=VALUE as two fields, such as TESSEL_STRING1_NAME and TESSEL_STRING1_VALUE.
   template <size_t N>
-  void addSlots(const std::string& kind, const std::array<std::optional<std::string>, N>& pairs,
-                bool number) {
-    for (size_t slot = 0; slot < N; ++slot)
-      addSlot(kind + std::to_string(slot + 1), pairs[slot], number);
-  }
-  void addSlot(const std::string& slot, const std::optional<std::string>& pair, bool number) {
-    if (!pair) return;
-    const size_t equals = pair->find('=');
-    if (equals == std::string::npos) return complain("'" + *pair + "' is not LABEL=VALUE");
-    const std::string value = pair->substr(equals + 1);
-    if (number && !parseDecimal(value)) return complain("'" + value + "' is no decimal number");
-    add("TESSEL_" + slot + "_NAME", pair->substr(0, equals));
-    add("TESSEL_" + slot + "_VALUE", value);
-  }
-  void addDecimal(const std::string& name, const std::optional<std::string>& value) {
-    if (value && !parseFloat(*value)) return complain("'" + *value + "' is no decimal number");
-    add(name, value);
+  void addLabelled(FieldKind name, FieldKind value,
+                   const std::array<std::optional<std::string>, N>& pairs) {
+    for (size_t i = 0; i < N; ++i) {
+      if (!pairs[i]) continue;
+      const size_t equals = pairs[i]->find('=');
+      if (equals == std::string::npos) return complain("'" + *pairs[i] + "' is not LABEL=VALUE");
+      add(labelled(name, i), pairs[i]->substr(0, equals));
+      add(labelled(value, i), pairs[i]->substr(equals + 1));
+    }
   }
   void addAttributes(const std::vector<std::string>& attributes) {
     if (attributes.size() > kMaxAttributes) {
       complain("more than " + std::to_string(kMaxAttributes) + " attributes");
     }
-    for (const std::string& attribute : attributes) {
-      const size_t equals = attribute.find('=');
-      if (equals == 0 || equals == std::string::npos) {
-        return complain("'" + attribute + "' is not KEY=VALUE");
-      }
-      add("TESSEL_ATTRIBUTE", attribute);
-    }
+    for (const std::string& attribute : attributes) add(FieldKind::attribute, attribute);
   }
   void addOther(const std::string& field) {
     const size_t equals = field.find('=');
@@ -92,6 +85,7 @@ class FieldList {
 
   std::vector<RecordedField> fields_;
   std::string complaint_;
+  TracePointTable reader_;
 };
 
 }  // namespace
@@ -100,17 +94,17 @@ std::variant<std::vector<RecordedField>, std::string> fieldsOf(const RecordedPoi
                                                                const std::string& kind) {
   FieldList list;
   list.add("MESSAGE", point.message);
-  list.add("TESSEL_KIND", kind);
-  list.add("TESSEL_SUBSYSTEM", point.subsystem);
-  list.add("TESSEL_CATEGORY", point.category);
-  list.add("TESSEL_NAME", point.name);
-  list.add("TESSEL_INTERVAL_ID", point.id);
-  list.add("TESSEL_INTERVAL_SCOPE", point.scope);
-  if (point.telemetry) list.add("TESSEL_TELEMETRY", std::string("1"));
-  list.addSlots("STRING", point.strings, false);
-  list.addSlots("NUMBER", point.numbers, true);
-  list.addDecimal("TESSEL_DURATION", point.duration);
-  list.addDecimal("TESSEL_FRAME_RATE", point.frameRate);
+  list.add(FieldKind::pointKind, kind);
+  list.add(FieldKind::subsystem, point.subsystem);
+  list.add(FieldKind::category, point.category);
+  list.add(FieldKind::name, point.name);
+  list.add(FieldKind::intervalId, point.id);
+  list.add(FieldKind::scope, point.scope);
+  if (point.telemetry) list.add(FieldKind::telemetry, "1");
+  list.addLabelled(FieldKind::string1Name, FieldKind::string1Value, point.strings);
+  list.addLabelled(FieldKind::number1Name, FieldKind::number1Value, point.numbers);
+  list.add(FieldKind::duration, point.duration);
+  list.add(FieldKind::frameRate, point.frameRate);
   list.addAttributes(point.attributes);
   for (const std::string& field : point.fields) list.addOther(field);
   return std::move(list).result();

@@ -1,13 +1,13 @@
 // Which texts are numbers, and of which kind.
 
-#include "trace/DecimalNumber.h"
+#include "trace/TracePointFields.h"
 
 #include <gtest/gtest.h>
 
 namespace tessel {
 namespace {
 
-TEST(DecimalNumberTest, keepsIntegersAndReadsTheRestAsDoubles) {
+TEST(DecimalNumberTest, keepsIntegersElseDoubles) {
   const struct {
     std::string_view text;
     std::optional<Number> number;
