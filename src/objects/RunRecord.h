@@ -1,8 +1,11 @@
 // RunRecord: what a run came to.
 //
-// The run fills it, the composition adds what spool and marker say, and the record is kept as
-// `<state>/last_run.json` for whoever asks later; each run replaces the record of the one before. A
-// run that died leaves none, so the record is then older than the scheduler's note of the last run.
+// The run fills it, and main.cpp adds what became of the spool's rows and of the run marker. The
+// record is then kept as `<state>/last_run.json`; each run replaces the record of the run before.
+//
+// A run that dies leaves neither a record nor the scheduler's note of its begin, because both are
+// written at the end. Only the run marker tells of it. The scheduler's note is newer than the
+// record where the last run was not tasked, or where its record could not be written.
 //
 // A plain value; one thread at a time.
 

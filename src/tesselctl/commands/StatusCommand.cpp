@@ -153,7 +153,8 @@ class Screen {
       if (status_.hasBooks()) books(run);
       if (run.reading) store(*run.reading, run.logEvents);
     }
-    // The scheduler notes each run when it begins, the record comes at its end.
+    // The scheduler notes a run after it has ended. The note is newer than the record only where
+    // the run kept none.
     if (status_.runWithoutRecord()) {
       more(std::string(status_.run ? "A later run began " : "A run began ") +
            since(*status_.lastBegin) +

@@ -36,7 +36,8 @@ struct ReporterStatus {
   std::optional<std::string> deferral;  // why one is wanted
   Marker marker;
   std::optional<RunRecord> run;
-  std::optional<Date> lastBegin;  // of the last run, recorded or not
+  // When the last run began that came to its end and was not deferred. The scheduler notes it.
+  std::optional<Date> lastBegin;
   SpoolReader::State spoolState = SpoolReader::State::absent;
   std::string spoolFailure;
   SpoolContents spool;
@@ -54,7 +55,8 @@ struct ReporterStatus {
   bool keepsADay() const {
     return journal.oldest && *journal.oldest <= now - std::chrono::hours{24};
   }
-  // Whether a later run than the recorded one began.
+  // Whether a later run than the recorded one came to its end. It was not tasked, or its record
+  // could not be written. A run that dies leaves no note, so it does not show here.
   bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
 };
 
