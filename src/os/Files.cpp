@@ -26,12 +26,13 @@ PlatformError fileError(const std::string& what, int errnoValue) {
 }
 
 std::optional<std::string> readSmallFile(const std::string& path, size_t maximum) {
-  // Opening a pipe waits for its writer. We must open before we can see what it is, so we ask not
-  // to wait.
+  // Opening a pipe normally waits for its writer. Only an open descriptor tells safely what the
+  // path is, so we open without waiting (O_NONBLOCK) and look then.
   const UniqueFd file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   struct stat facts {};
   if (!file.valid() || ::fstat(file.get(), &facts) != 0 || !S_ISREG(facts.st_mode)) return {};
-  // The size is no help: files of /proc and /sys say 0 or a page, whatever they hold.
+  // We read until the end, because the size is no help: files of /proc and /sys have a size of 0 or
+  // one page, whatever they hold.
   std::string text;
   char buffer[4096];
   for (;;) {
@@ -69,14 +70,14 @@ bool flushDirectory(const std::string& path) {
   return directory.valid() && ::fsync(directory.get()) == 0;
 }
 
-// Writing in place would leave half a text where the power fails. A rename is all or nothing, but
-// the file system may write it before the data: a power cut would then leave an empty file. So the
-// data are flushed before the rename. The rename is on disk once the directory is flushed. The
-// price is two waits for the disk, which is nothing for files that are written a few times a day.
+// Writing in place would leave half a text after a power cut. A rename is all or nothing, but the
+// file system may put it on disk before the data, and a power cut would then leave an empty file.
+// So we flush the data before the rename, and the directory after it. The price is two waits for
+// the disk, which is small for files that are written a few times a day.
 std::optional<PlatformError> replaceFileDurably(const std::string& path, std::string_view text,
                                                 unsigned permissions) {
   const std::string fresh = path + ".new";
-  // A link under this name would let another user choose the file that we overwrite.
+  // O_NOFOLLOW: a link under this name would let another user choose the file that we overwrite.
   const UniqueFd file(
       ::open(fresh.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, permissions));
   if (!file.valid() || !writeAll(file.get(), text) || ::fsync(file.get()) != 0)

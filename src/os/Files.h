@@ -1,5 +1,5 @@
-// What every room that touches the file system shares: errors in words, small files, new files, and
-// files that outlast a power cut.
+// File functions for every room that touches the file system: errors in words, small files, new
+// files, and files that survive a power cut.
 //
 // Stateless; any thread, unless a function says otherwise.
 
@@ -15,35 +15,37 @@
 
 namespace tessel {
 
-// What an errno value means, in words.
+// The words for an errno value.
 std::string errorWords(int errnoValue);
-// The error about a file: its code, and "what: words". `what` names the file.
+// The error for an errno value. Its words are "what: errorWords()"; `what` names the file.
 PlatformError fileError(const std::string& what, int errnoValue);
 
-// The whole of a regular, proc or sysfs file. Absent where it cannot be opened or read, is no file,
-// or holds more than `maximum` bytes. Never waits for the writer of a pipe.
+// The whole content of a regular, proc or sysfs file. Absent if it cannot be opened or read, is
+// something else (a directory, a pipe), or holds more than `maximum` bytes. Never waits for the
+// writer of a pipe.
 std::optional<std::string> readSmallFile(const std::string& path, size_t maximum);
 
-// Writes all of `text`; false with errno set where that fails.
+// Writes all of `text`. False, with errno set, if that fails.
 bool writeAll(int fd, std::string_view text);
 
-// Makes an empty file with `permissions`, as far as the mask of the process leaves them. False with
-// errno set where that fails; EEXIST where anything stands there, a broken link included.
+// Makes an empty file with `permissions`, less the umask of the process. False, with errno set, if
+// that fails. errno is EEXIST if the path exists already, even as a broken link.
 bool createNewFile(const std::string& path, unsigned permissions);
 
-// A descriptor of the directory, for flock(), fsync() and the *at() functions. Not valid, with
-// errno set, where it cannot be opened.
+// A descriptor of the directory, for flock(), fsync() and the *at() functions. If the directory
+// cannot be opened, the result is not valid() and errno is set.
 UniqueFd openDirectory(const std::string& path);
 
-// Makes `path` hold `text`. Whoever opens it, at any time and after a power cut, finds all of the
-// old text or all of the new. Writes `<path>.new` first, so two callers must not write one path at
-// the same time. A new file has `permissions`, as far as the mask of the process leaves them.
-// Absent where that succeeded. After an error the old file still stands, unless it was the
-// flushing of the directory that failed: then either may stand after a power cut.
+// Replaces the content of `path` by `text`. A reader finds all of the old text or all of the new,
+// at any moment and after a power cut. The text goes to `<path>.new` first, so two callers must not
+// write the same path at the same time. The file has `permissions`, less the umask of the process.
+//
+// Absent if that succeeded. After an error `path` still holds the old text, with one exception: if
+// only the flush of the directory failed, it holds the new text, which a power cut may undo.
 std::optional<PlatformError> replaceFileDurably(const std::string& path, std::string_view text,
                                                 unsigned permissions = 0640);
 
-// Makes the present names in the directory outlast a power cut; false where that fails.
+// Makes the names that stand in the directory now survive a power cut. False if that fails.
 bool flushDirectory(const std::string& path);
 
 }  // namespace tessel

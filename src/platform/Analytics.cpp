@@ -1,8 +1,7 @@
 // The arithmetic of pacing: Throttle, the one part of Analytics.h with a body.
 //
-// The bound protects whoever takes the events: 10 in 125 ms are 80 a second. A quantum is measured
-// from its own beginning and never carries unused time over, so that no burst of more than 10
-// events follows a quiet while.
+// The bound protects the receiver of the events: 10 in 125 ms are 80 a second. Each quantum begins
+// anew and carries no unused time over. Otherwise a burst would follow each quiet time.
 
 #include "platform/Analytics.h"
 
@@ -16,7 +15,8 @@ constexpr uint32_t eventsPerQuantum = 10;
 
 void Throttle::setUp() {
   const Timebase timebase = clock_.timebase();
-  // The first step sets up, and not the constructor: the first quantum begins with the first send.
+  // The first step calls this, and not the constructor, so that the first quantum begins with the
+  // first send.
   microsecondsPerMachUnit_ =
       static_cast<double>(timebase.numerator) / static_cast<double>(timebase.denominator) / 1000.0;
   quantumMicroseconds_ = 125000.0f;
@@ -39,7 +39,8 @@ void Throttle::throttleReportedEvent() {
 
 void Throttle::sleepForRestOfQuantum(double elapsedMicroseconds) {
   const double quantum = static_cast<double>(quantumMicroseconds_);
-  // Written so that a NaN, of a timebase with denominator 0, does not sleep.
+  // A timebase with denominator 0 can make this NaN. A NaN is not less than anything, so it
+  // returns.
   if (!(elapsedMicroseconds < quantum)) return;
   const auto sleep = static_cast<uint32_t>(quantum - elapsedMicroseconds);
   tesselReporterLog().debug("Sleeping for %u us", sleep);

@@ -59,13 +59,13 @@ class ConfigurationService {
   virtual std::shared_ptr<ConfigurationObserver> makeObserver() = 0;
 };
 
-// Throttle: paces what is sent to at most 10 events per 125,000 microseconds.
+// Throttle: slows the sending of events down to at most 10 per 125,000 microseconds.
 //
 // Take a step before every send. Each tenth step closes a quantum and sleeps for what is left of
 // its 125,000 microseconds. The other nine cost an increment and a comparison.
 //
-// One object serves the whole process, and its counters go on from run to run. Threads: one at a
-// time. Callers follow one another, so it has no lock.
+// One object serves the whole process, and its counters go on from run to run. It has no lock, so
+// only one thread at a time may use it.
 class Throttle {
  public:
   explicit Throttle(Clock& clock) : clock_(clock) {}

@@ -1,4 +1,5 @@
-// PlatformError: the outside failed. Programs decide by the code; the words are for people.
+// PlatformError: how something outside of this program failed. Programs decide by the code; people
+// read the words.
 //
 // A plain value; any thread.
 
@@ -17,7 +18,6 @@ enum class ErrorCode : uint8_t {
   notAStore,  // it can be read, but nothing in it is a journal
 };
 
-// The code of an errno.
 constexpr ErrorCode codeOf(int error) {
   switch (error) {
     case ENOENT:
@@ -34,7 +34,7 @@ constexpr ErrorCode codeOf(int error) {
 
 struct PlatformError {
   ErrorCode code = ErrorCode::failed;
-  std::string words;  // one sentence, with the path that it is about
+  std::string words;  // one sentence; it names the path that failed
 };
 
 }  // namespace tessel

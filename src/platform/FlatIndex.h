@@ -1,22 +1,23 @@
-// FlatIndex: finds a thing of a user's slab by its hash. With it, the seeded hash of small words.
+// FlatIndex: a hash index over items that its user keeps. With it, the seeded hash of small words.
 //
-// The user keeps its things in a vector or the like and numbers them; the index keeps, for each, a
-// 32-bit hash and that number, and asks the user whether the thing of a number is the one it looks
-// for. So one index serves keys of any kind, growing it touches no key, and a key is only looked
-// at where all 32 bits of the hash agree.
+// The user keeps its items in a vector or the like and numbers them. The index keeps a 32-bit hash
+// and that number for each item. In a search it asks the user whether the item of a number is the
+// one that is wanted. So one index serves keys of any kind, and growing it touches no key. A key is
+// compared only where all 32 bits of the hash agree.
 //
-// The slots are one array, searched from the hash's own slot onwards (open addressing with linear
-// probing). At most half of them are taken: then a search for what is not there, which is most of
-// them here, looks at 2.5 slots on average, and all of them usually lie in one cache line. At seven
-// eighths it would look at 32. A slot takes 8 bytes, so the price is 16 to 32 bytes a thing.
+// The slots are one array. A search begins at the hash's own slot and goes on from there (open
+// addressing with linear probing). At most half of the slots are taken. Most searches here are for
+// items that are not in the index, and at half load such a search looks at 2.5 slots on average,
+// which usually lie in one cache line. At seven eighths it would look at 32. A slot takes 8 bytes,
+// so an item costs 16 to 32 bytes.
 //
-// Chained buckets were not taken because every link is a cache miss, nor robin-hood probing
-// because at half load it only adds moves.
+// Chained buckets were discarded, because every link is a cache miss. Robin-hood probing was
+// discarded, because at half load it only adds moves.
 //
-// Hashes must be seeded (hashWords(), hashText()): a writer who could choose keys with equal hashes
-// would make every search as long as the table. The answers are right even then.
+// Hashes must be seeded (hashWords(), hashText()). A writer who could choose keys with equal hashes
+// would make every search as long as the table; the answers would still be right.
 //
-// Threads: one at a time where it changes. Any number of threads may search it between changes.
+// Threads: only one while it changes. Any number of threads may search it between changes.
 
 #pragma once
 
@@ -45,7 +46,7 @@ inline const HashSeeds& hashSeeds() {
   return seeds;
 }
 
-// The two halves of the full product, folded into one word: every bit of both factors counts.
+// Folds the 128-bit product into one word, so that every bit of both factors counts.
 inline uint64_t mixWords(uint64_t a, uint64_t b) {
   __extension__ using Wide = unsigned __int128;
   const Wide product = Wide{a} * b;
@@ -63,10 +64,10 @@ uint32_t hashWords(Words... words) {
 
 class FlatIndex {
  public:
-  // Stands for "no number"; no thing may have it.
+  // Stands for "no number"; no item may have it.
   static constexpr uint32_t kNone = UINT32_MAX;
 
-  // Room for `expected` things before the index grows for the first time.
+  // Has room for `expected` items before it grows for the first time.
   explicit FlatIndex(size_t expected = 8)
       : slots_(std::bit_ceil(std::max<size_t>(2 * expected, 2))) {}
 
@@ -75,15 +76,15 @@ class FlatIndex {
   uint32_t find(uint32_t hash, const IsIt& isIt) const {
     return slots_[slotOf(hash, isIt)].number;
   }
-  // The same; where there is none, the number that `add()` answers goes in under `hash`. `add` may
-  // change the slab but not this index. Only a number that is new makes the index allocate.
+  // The same. If there is none, enters the number that `add()` answers under `hash`. `add` may
+  // change the user's items but not this index. A search that finds its number allocates nothing.
   template <typename IsIt, typename Add>
   uint32_t findOrAdd(uint32_t hash, const IsIt& isIt, const Add& add) {
     const size_t at = slotOf(hash, isIt);
     if (slots_[at].number != kNone) return slots_[at].number;
     return put(at, {hash, add()});
   }
-  // REQUIRES: the thing of `number` is not in the index.
+  // REQUIRES: the item of `number` is not in the index.
   void add(uint32_t hash, uint32_t number) { put(slotOf(hash, isNone), {hash, number}); }
   // REQUIRES: `number` is in the index, under `hash`.
   void erase(uint32_t hash, uint32_t number) {
@@ -107,7 +108,7 @@ class FlatIndex {
   };
 
   static bool isNone(uint32_t) { return false; }
-  // The slot of the number that is looked for, or the free one where it would stand.
+  // The slot of the number that is wanted, or else the free slot where it would stand.
   template <typename IsIt>
   size_t slotOf(uint32_t hash, const IsIt& isIt) const {
     const size_t mask = slots_.size() - 1;
@@ -122,9 +123,9 @@ class FlatIndex {
     if (++size_ * 2 > slots_.size()) grow();
     return slot.number;
   }
-  // Frees the slot at `hole`. A search ends at a free slot, so each number behind the hole that was
-  // pushed beyond it moves back into it, and leaves a hole of its own. A number was pushed beyond
-  // the hole where its own slot is not behind it.
+  // Frees the slot at `hole`. A search ends at a free slot, so a hole must not stand between a
+  // number and the slot that its hash names. Each number that was pushed beyond the hole moves back
+  // into it and leaves a new hole. A number stays if its hash names a slot behind the hole.
   void close(size_t hole) {
     const size_t mask = slots_.size() - 1;
     for (size_t at = (hole + 1) & mask; slots_[at].number != kNone; at = (at + 1) & mask) {
@@ -143,7 +144,7 @@ class FlatIndex {
     }
   }
 
-  std::vector<Slot> slots_;  // a power of two, so that a mask takes the place of a division
+  std::vector<Slot> slots_;  // their number is a power of two, so a mask replaces a division
   size_t size_ = 0;
 };
 

@@ -1,9 +1,9 @@
 // TESSEL_INVARIANT: a check of our own bookkeeping that stays in the release build.
 //
-// The books are what this service is for. A run that has lost count must not send a summary that
-// looks right, so it ends here, with the place, and the marker that it leaves makes it seen. Only
-// our own mistakes are checked like this: whatever came from outside is counted under a reason
-// instead. Any thread.
+// This service exists to account for every trace point. A run that has lost count must not send a
+// summary that looks right. So the process aborts and names the place, and the run marker that it
+// leaves makes the next run notice it. Only our own mistakes are checked like this; bad input is
+// counted under a reason instead. Any thread.
 
 #pragma once
 

@@ -11,7 +11,7 @@ namespace tessel {
 
 namespace {
 
-// JSON's escapes of one letter, those that are shorter than \uNNNN.
+// The letter of JSON's short escape, such as 'n' for a line feed. '\0' if there is none.
 char shortEscape(char32_t point) {
   switch (point) {
     case '"':
@@ -32,10 +32,10 @@ char shortEscape(char32_t point) {
   }
 }
 
-// JSON wants the C0 controls escaped; DEL is escaped with them, since it is one to every reader but
-// a JSON parser. JSON leaves the C1 controls and the marks of direction bare, a terminal obeys
-// them: for a terminal they are escaped as well, which means the same string to a parser. Whoever
-// looks at `tesselctl --json` on a screen is then as safe as with the tables.
+// JSON requires escapes for the C0 controls. DEL is escaped with them, because every other reader
+// takes it for a control too. JSON allows the C1 controls and the marks of direction as they are,
+// but a terminal obeys them, so for a terminal they are escaped as well. A parser reads the same
+// string either way, and `tesselctl --json` on a screen is as safe as the tables.
 bool isEscaped(char32_t point, bool forTerminal) {
   return point < 0x20 || point == 0x7f || (forTerminal && isObeyed(point));
 }
@@ -50,8 +50,8 @@ void appendDigits(std::string& out, Value value) {
 
 void appendJsonString(std::string& out, std::string_view text, bool forTerminal) {
   out += '"';
-  // Nearly every text is plain ASCII to its end. To decode each of its characters would be most of
-  // what a record costs.
+  // Nearly every text is plain ASCII to its end, so this loop copies it without decoding. Decoding
+  // each character would be most of the cost of a record.
   size_t plain = 0;
   while (plain < text.size() && text[plain] >= 0x20 && text[plain] < 0x7f && text[plain] != '"' &&
          text[plain] != '\\') {
@@ -76,9 +76,8 @@ void appendJsonString(std::string& out, std::string_view text, bool forTerminal)
   out += '"';
 }
 
-// Valid JSON has its own controls escaped, so a bare one stands between tokens and a space does as
-// well. What a terminal may obey beyond them can only stand in a string, where an escape means the
-// same.
+// In valid JSON a bare C0 control can only stand between tokens, where a space means the same. Any
+// other character that a terminal obeys can only stand in a string, where an escape means the same.
 JsonWriter& JsonWriter::raw(std::string_view json) {
   separate();
   if (!style_.forTerminal) {
@@ -117,8 +116,8 @@ void JsonWriter::close(char bracket) {
   place_ = Place::value;
 }
 
-// Called before each key and value. The comma depends on what stands before it alone, so no stack
-// of open brackets is kept.
+// Called before each key and value. Only what was written last decides whether a comma is needed,
+// so no stack of open brackets is kept.
 void JsonWriter::separate() {
   if (place_ == Place::value) out_ += ',';
   if (place_ == Place::value || place_ == Place::opening) newLine();

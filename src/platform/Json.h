@@ -5,9 +5,8 @@
 //     json.array("files", files, [&](const File& file) { json.value(file.path); });
 //   });
 //
-// Everything that this system writes as JSON passes through here: payloads in the spool, the run
-// record, what is sent and what tesselctl prints. Only what is read back needs a parser. A writer
-// is used by one thread at a time.
+// All JSON that this system writes passes through here: payloads in the spool, the run record,
+// requests to a collector and the output of tesselctl. One thread at a time uses a writer.
 
 #pragma once
 
@@ -22,9 +21,9 @@
 namespace tessel {
 
 struct JsonStyle {
-  // Nothing in the JSON is left that a terminal may obey.
+  // Escapes every character that a terminal may obey.
   bool forTerminal = false;
-  // Spaces for each level; 0 writes all on one line, without any.
+  // Spaces for each level. 0: everything stands on one line, without spaces.
   size_t indent = 0;
 };
 
@@ -37,15 +36,15 @@ class JsonWriter {
   JsonWriter(const JsonWriter&) = delete;
   JsonWriter& operator=(const JsonWriter&) = delete;
 
-  // A text, a number, a bool, a date (microseconds since 1970), what an optional holds, or what a
-  // variant of these holds. Numbers get the shortest digits that read back as the same number of
-  // their own type. One that is not finite is null, which is what JSON can say of it.
+  // A text, a number, a bool, a date (microseconds since 1970), or an optional or a variant that
+  // holds one of these. Numbers get the shortest digits that read back as the same number of their
+  // own type. JSON has no infinity and no NaN, so a number that is not finite is written as null.
   template <typename T>
   JsonWriter& value(const T& value);
   // `json` is one valid JSON value in UTF-8.
   JsonWriter& raw(std::string_view json);
 
-  // Members of an object. An absent text and an empty optional leave out their key as well.
+  // A member of an object. Nothing is written if the text is absent or the optional is empty.
   template <typename T>
   JsonWriter& member(std::string_view name, const T& value);
   JsonWriter& rawMember(std::string_view name, std::string_view json) {
@@ -66,7 +65,7 @@ class JsonWriter {
   JsonWriter& array(std::string_view name, const Items& items, Write&& write);
 
  private:
-  // What stands before the place that is written next.
+  // What was written last.
   enum class Place { nothing, opening, key, value };
 
   JsonWriter& key(std::string_view name);

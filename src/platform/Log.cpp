@@ -1,6 +1,6 @@
 // The installed sink, the service's handle, and the formatting of checked texts.
 //
-// The sink is the one global of the program: almost every part logs, and a reference in each
+// The sink is global on purpose. Almost every part logs, so a reference to the sink in each
 // constructor would say nothing about that part.
 
 #include "platform/Log.h"
@@ -52,7 +52,8 @@ std::atomic<int> enabledLogLevels{0};
 }
 
 void setLogSink(LogSink* sink, LogLevel level) {
-  // The sink first and the level last: who sees an enabled level also sees its sink.
+  // The sink comes first, so that an enabled level has its sink. isEnabled() must be cheap and
+  // reads the level without ordering, so write() still checks that there is a sink.
   installedSink.store(sink, std::memory_order_release);
   detail::enabledLogLevels.store(sink ? static_cast<int>(level) + 1 : 0, std::memory_order_release);
 }

@@ -53,8 +53,7 @@ consteval LogArgumentKind kindOf() {
 
 struct LogConversion {
   LogArgumentKind kind;
-  size_t length;  // of the conversion, the percent sign included; 0 if it is not one of those that
-                  // are known
+  size_t length;  // with the percent sign; 0 if the conversion is unknown
 };
 
 constexpr LogConversion conversionAt(std::string_view rest) {
@@ -148,7 +147,7 @@ class LogSink {
 // caller keeps the sink until the last thread that logs has ended.
 void setLogSink(LogSink* sink, LogLevel level);
 
-// Names who logs. Each program has one; the category is its name in the log.
+// Names the program that logs. Each program has one handle, whose category is its name in the log.
 class LogHandle {
  public:
   constexpr LogHandle(std::string_view subsystem, std::string_view category)

@@ -1,7 +1,7 @@
 // The names of losses, and the list of them.
 //
-// The list is searched from one end to the other, because it is short: a usual day has fewer than
-// ten losses, and nine codes of 17 are the most that there can be.
+// The list is short, so it is searched from one end to the other. A usual day has fewer than ten
+// losses. The most are nine codes with 17 losses each: 16 and the "other" one.
 
 #include "platform/Losses.h"
 
@@ -22,9 +22,8 @@ constexpr std::array<std::string_view, kLossCodes> kNames = {
     "entries_missing", "dropped_by_daemon",     "no_image_path",
     "malformed",       "open_interval_dropped", "beyond_pair_limit"};
 
-// A failing disk damages many files in the same way. What is damaged then says more than each file
-// that has it, so damage is summed over the files. A file that was not read is a loss of its own,
-// and so is what a unit lost.
+// A failing disk damages many files in the same way. The kind of damage then says more than the
+// list of files, so damage is summed over all files. Losses of the other codes stay apart by place.
 bool sumsPlaces(LossCode code) { return code == LossCode::fileDamaged; }
 
 bool isSame(const Loss& a, const Loss& b) {
@@ -63,10 +62,10 @@ void Losses::add(Loss loss) {
   uint64_t& sum = sums_[static_cast<size_t>(code)];
   sum += loss.count;
   const auto [first, last] = std::ranges::equal_range(losses_, code, {}, &Loss::code);
-  // The "other" loss is the last of its code, so what has no room yet goes in before it.
+  // The "other" loss stays the last of its code, so a new loss goes in before it.
   const auto other = first != last && std::prev(last)->isOther() ? std::prev(last) : last;
   auto known = std::find_if(first, last, [&](const Loss& one) { return isSame(one, loss); });
-  // A store of many bad files must not fill the list, but it must not hide a loss either.
+  // A store of many bad files must not fill the list, but no loss may go uncounted either.
   if (known == last && static_cast<size_t>(other - first) >= kMaxOfACode) loss.words = kOther;
   if (loss.isOther()) known = other;
   if (known != last) {
@@ -75,7 +74,7 @@ void Losses::add(Loss loss) {
   } else {
     losses_.insert(loss.isOther() ? last : other, std::move(loss));
   }
-  // Merging and the lack of room change what is told apart, never how much was lost.
+  // Merged or moved to "other", a loss keeps its count: the list and the sum must agree.
   uint64_t listed = 0;
   for (const Loss& one : losses_) listed += one.code == code ? one.count : 0;
   TESSEL_INVARIANT(listed == sum);

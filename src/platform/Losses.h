@@ -1,11 +1,11 @@
-// Losses: what was lost of a trace store, and StoreReading: what was read of it.
+// Losses: what was lost of a trace store. StoreReading: what was read of it.
 //
-// Whoever loses something adds it here, with its words. From there the same list goes to the log,
-// into the record of the run and to every command, so that all of them tell the same. Programs go
-// by the code, people by the words.
+// The part that loses something adds it here and describes it in words. The log, the record of the
+// run and every command show this one list, so they cannot disagree. Programs go by the code,
+// people by the words.
 //
-// Words and places are kept as they were met. They may hold any bytes: whoever shows them makes
-// them fit for a terminal, for JSON or for HTML.
+// Words and places are kept unchanged and may hold any bytes. The code that shows them escapes them
+// for a terminal, for JSON or for HTML.
 //
 // Plain values; one thread at a time.
 
@@ -23,25 +23,25 @@ namespace tessel {
 
 // In the order in which losses are shown.
 enum class LossCode : uint8_t {
-  fileSkipped,          // a file that was not read; the place is its path
+  fileSkipped,          // files that were not read; the place is the path
   filesNotLookedAt,     // files beyond the limit on their number
-  fileDamaged,          // damage that was met in files; the place is the first file and the byte
+  fileDamaged,          // damaged spots in files; the place is the first file and its byte
   entriesMissing,       // sequence numbers that no entry has
   droppedByDaemon,      // entries that the journal daemon dropped; the place is the unit
   noImagePath,          // trace points whose executable is not known
-  malformed,            // entries that mean to be trace points and are none
-  openIntervalDropped,  // begins that gave way to younger ones
-  beyondPairLimit,      // objects whose pair of subsystem and category was one too many
+  malformed,            // entries with the mark of a trace point but bad fields
+  openIntervalDropped,  // begins that were dropped to make room for younger ones
+  beyondPairLimit,      // objects whose pair of subsystem and category was not kept
 };
 inline constexpr size_t kLossCodes = 9;
 
-// "file_skipped", "files_not_looked_at" and so on, as JSON and the documentation have it.
+// The name in JSON and in the documentation, such as "file_skipped".
 std::string_view lossName(LossCode code);
-// Nothing where no code has this name.
+// Absent if no code has this name.
 std::optional<LossCode> lossNamed(std::string_view name);
 
 struct LossPlace {
-  std::string name;                // a file, a unit; empty where there is none
+  std::string name;                // of a file or a unit; empty if there is none
   std::optional<uint64_t> offset;  // bytes from the start of that file
 
   bool operator==(const LossPlace&) const = default;
@@ -51,39 +51,39 @@ struct Loss {
   LossCode code{};
   uint64_t count = 0;
   std::string words;
-  LossPlace place;      // where it was met first
-  uint64_t places = 1;  // at how many
+  LossPlace place;      // the first of its places
+  uint64_t places = 1;  // how many places it has
 
-  // Place, offset and number of further places, such as "/a.journal, byte 8, and 2 more"; empty
-  // where there is no place.
+  // Place, offset and number of further places, such as "/a.journal, byte 8, and 2 more". Empty if
+  // there is no place.
   std::string where() const;
-  // Without the count: "file_skipped: Permission denied (/a.journal)".
+  // Everything but the count: "file_skipped: Permission denied (/a.journal)".
   std::string description() const;
-  // Whether it stands for all those of its code that the list had no room for.
+  // Whether it is the sum of the losses of its code that the list had no room for.
   bool isOther() const;
   bool operator==(const Loss&) const = default;
 };
 
 class Losses {
  public:
-  // Losses of one code that are told apart. Sixteen fill a screen with the other codes, and keep
-  // the record of a run small.
+  // How many losses of one code are listed one by one. Sixteen still fit on a screen beside the
+  // losses of the other codes, and they keep the record of a run small.
   static constexpr size_t kMaxOfACode = 16;
 
-  // Adds to the loss of equal code, words and place where there is one; damage is added to that of
-  // equal words in any place. Beyond kMaxOfACode it is added to the "other" loss of its code. A
-  // count of 0 is no loss.
+  // Adds a loss. If the list has one with the same code, words and place name, their counts are
+  // summed; for damage the place does not matter. If kMaxOfACode losses of the code are listed
+  // already, the "other" loss of that code takes the count. A count of 0 changes nothing.
   void add(Loss loss);
   void add(LossCode code, std::string_view words, const LossPlace& place, uint64_t count = 1);
   // Adds each loss of `others`.
   void add(const Losses& others);
 
-  // By code; those of one code in order of arrival, the "other" one last.
+  // Sorted by code. Losses of one code stand in order of arrival, with the "other" loss last.
   const std::vector<Loss>& all() const { return losses_; }
   bool empty() const { return losses_.empty(); }
-  // Of all losses of the code, "other" included.
+  // The count of all losses of the code, "other" included.
   uint64_t sum(LossCode code) const { return sums_[static_cast<size_t>(code)]; }
-  // Counted under "other".
+  // The part of sum() that stands under "other".
   uint64_t notListed(LossCode code) const;
 
   bool operator==(const Losses&) const = default;
@@ -97,13 +97,13 @@ class Losses {
 struct StoreReading {
   uint64_t entriesRead = 0;       // of the period, each once
   uint64_t duplicateEntries = 0;  // left out because they stand in another file as well
-  // Microseconds since 1970 of the oldest entry that the store still holds, of those read and by
-  // the headers of those that were not; absent where there is none.
+  // The oldest entry that the store still holds, in microseconds since 1970. For a file that was
+  // not read, its header tells. Absent if there is no entry.
   std::optional<uint64_t> oldestEntry;
   uint64_t rangeStart = 0;    // microseconds since 1970
   uint64_t sequenceGaps = 0;  // jumps of the sequence number by more than one
   uint64_t filesRead = 0;
-  uint64_t filesOutsideRange = 0;  // left alone because all in them is of another period
+  uint64_t filesOutsideRange = 0;  // not read, because all their entries are of another period
   Losses losses;
 
   // Whether the store reaches back to the start of the period.

@@ -6,14 +6,14 @@
 // thread for each would cost a stack and a wakeup for nothing. A pool of fixed size was discarded,
 // because a queue may wait for another (sync), and a full pool would then wait for ever.
 //
-// Every thread is detached. To join them at the end, the process would have to wait for closures
-// that may sleep for long (the throttle) or wait for something that will not come.
+// Every thread is detached. To join the threads at its end, the process would have to wait for
+// closures that sleep (the throttle) or that wait for an event which never comes.
 //
 // So exit(0) may meet threads that are still running. The C library then destroys the objects with
 // static storage while those threads go on. Whatever they touch (Threads, TimerThread, the sink of
-// the log) is made by `new` and never deleted; a queue's state lives as long as the thread that
-// works on it. An unfinished closure ends with the process, which its work must allow: the spool
-// loses no row by it, and a run leaves its marker.
+// the log) is made by `new` and never deleted, and a thread shares the state of the queue that it
+// works on. An unfinished closure ends with the process. That does no harm: the spool keeps every
+// row that it has taken, and a run leaves its marker.
 
 #include "platform/Queues.h"
 
@@ -33,7 +33,7 @@ namespace tessel {
 
 namespace {
 // An idle thread waits this long for work. A run submits its closures within microseconds of each
-// other, so one thread serves them all; and 20 ms later an idle process has none of them left.
+// other, so one thread serves them all. An idle process has no thread left after 20 ms.
 constexpr std::chrono::milliseconds kIdleThreadLife{20};
 }  // namespace
 
@@ -43,7 +43,7 @@ struct WorkerQueue::State {
   const std::string label;
   std::mutex mutex;
   std::list<Closure> work;  // a list, because an empty one has nothing on the heap
-  bool hasThread = false;   // or will have one soon
+  bool hasThread = false;   // a thread works on it or will do so soon
   bool working = false;     // a closure is running
 };
 
@@ -62,8 +62,8 @@ class WorkerQueue::Threads {
       arrived_.notify_one();
       return;
     }
-    // Start the thread under the lock, which it needs before it can end. detach() reads the
-    // thread's memory, and a thread that ended before would have given it back already.
+    // We hold the lock until the thread is detached. detach() reads memory that a thread gives back
+    // when it ends, and this thread needs the lock before it can end.
     std::thread([this] { run(); }).detach();
   }
 
@@ -116,14 +116,15 @@ void WorkerQueue::sync(const Closure& work) {
   }
 }
 
-// Runs everything that the queue holds. `hasThread` lets only one thread in, and that is what makes
-// the queue serial; each closure is destroyed before the next begins.
+// Runs everything that the queue holds. `hasThread` lets only one thread in, which makes the queue
+// serial. async() promises that each closure is destroyed right after it ran, so this does it
+// before the next one begins.
 void WorkerQueue::drain(State& state) {
   std::unique_lock lock(state.mutex);
   while (!state.work.empty()) {
     Closure work = std::move(state.work.front());
     state.work.pop_front();
-    // One at a time: the code of the service relies on it in place of locks.
+    // The service has no locks of its own: it relies on closures that run one at a time.
     TESSEL_INVARIANT(!state.working);
     state.working = true;
     lock.unlock();
@@ -152,7 +153,7 @@ struct Firing {
 };
 
 // The one thread that submits the handlers of all timers when they are due. It never runs a handler
-// itself, so a slow one delays no other timer. It lives as long as the process.
+// itself, so a slow handler delays no other timer. It lives as long as the process.
 class TimerThread {
  public:
   static TimerThread& shared() {
@@ -185,7 +186,8 @@ class TimerThread {
         continue;
       }
       firings_.pop();
-      // After a long sleep of the machine the missed firings are not made up for.
+      // A process that was stopped for a while must not fire once for each interval that it missed.
+      // It fires at most once more at once, and then goes on from now.
       next.due = std::max(next.due + next.timer->interval, now);
       firings_.push(next);
       lock.unlock();
@@ -219,7 +221,7 @@ std::shared_ptr<SerialQueue> WorkerQueueFactory::makeSerialQueue(std::string lab
 std::shared_ptr<RepeatingTimer> WorkerQueueFactory::makeRepeatingTimer(
     std::shared_ptr<SerialQueue> queue, std::chrono::nanoseconds interval,
     std::chrono::nanoseconds /*leeway*/, Closure handler) {
-  // The firings come on time, and any leeway allows that.
+  // The leeway lets a firing be late. Ours come on time, so it is not needed.
   return std::make_shared<SharedThreadTimer>(
       std::make_shared<TimerRecord>(TimerRecord{std::move(queue), interval, std::move(handler)}));
 }

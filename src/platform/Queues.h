@@ -49,8 +49,8 @@ class SerialQueue {
   virtual const std::string& label() const = 0;
   // Returns at once. `work` runs later and is destroyed right after that.
   virtual void async(Closure work) = 0;
-  // Returns after `work` has run. REQUIRES: not called from the queue itself, which would wait for
-  // itself.
+  // Returns after `work` has run. REQUIRES: not called on the queue itself, which would then wait
+  // for itself for ever.
   virtual void sync(const Closure& work) = 0;
 };
 
@@ -75,9 +75,9 @@ class QueueFactory {
                                                              Closure handler) = 0;
 };
 
-// A queue on threads. It has a thread only while it has work, so that an idle queue costs a few
-// hundred bytes. Its threads are never joined, and what they use is never destroyed, so the process
-// may end at any moment; see Queues.cpp.
+// A queue on threads. It has a thread only while it has work, so an idle queue costs a few hundred
+// bytes. Nobody joins the threads, and the objects that they use are never destroyed. So the
+// process may end at any moment; see Queues.cpp.
 class WorkerQueue final : public SerialQueue {
  public:
   explicit WorkerQueue(std::string label);

@@ -1,5 +1,5 @@
-// What the service asks of the system that it runs on: clocks, files and other facts; and what it
-// asks of whoever runs it: the activity scheduler, the process runtime, the service manager.
+// The roles that the service needs of the system (clocks, files, facts about the machine) and of
+// its surroundings (the activity scheduler, the process runtime, the service manager).
 
 #pragma once
 
@@ -146,8 +146,8 @@ class ServiceStatus {
   // What the process is doing now, in a few words for a human: "reading the trace store".
   virtual void say(std::string_view words) = 0;
   // Says that work moved on by a step. Cheap enough for every trace object: most calls only read a
-  // clock. If a process that works does not call it within its watchdog period, the manager takes
-  // the process for hung and kills it.
+  // clock. If a working process does not call it within the watchdog period, the manager takes the
+  // process for hung and kills it.
   virtual void progress() = 0;
 };
 

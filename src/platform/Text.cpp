@@ -1,8 +1,8 @@
-// Walking through UTF-8 and escaping what must not be shown as it is.
+// The walk through UTF-8, and the escapes.
 //
-// The walk decodes by hand. The C library decodes by the locale of the process, which a service
-// must not depend on, and the Unicode library is too much for the rooms that only use the standard
-// library. Decoding costs a table of four lengths and two exceptions.
+// The walk decodes by hand. The C library decodes by the locale of the process, and a service must
+// not depend on that. The Unicode library is no choice, because most rooms use nothing but the
+// standard library. Decoding by hand takes one small function, sequenceOf().
 
 #include "platform/Text.h"
 
@@ -12,16 +12,16 @@ namespace {
 
 constexpr std::string_view kReplacementCharacter = "\xef\xbf\xbd";
 
-// What may follow a lead byte. `length` is 0 where nothing begins with that byte.
+// Which bytes may follow a lead byte. `length` is 0 if no sequence begins with that byte.
 struct Sequence {
   size_t length = 0;
   unsigned lowestSecond = 0x80;
   unsigned highestSecond = 0xbf;
 };
 
-// The second byte alone decides whether a sequence is the shortest for its code point (after E0 and
-// F0), no surrogate (after ED), and within Unicode (after F4). Once it is checked, any continuation
-// byte will do for the rest. C0 and C1 could only write ASCII in two bytes, so they begin nothing.
+// Only the second byte needs bounds of its own. After E0 and F0 they exclude sequences that are
+// longer than need be, after ED surrogates, after F4 code points beyond Unicode. Any continuation
+// byte may follow it. C0 and C1 could only encode ASCII in two bytes, so they begin no sequence.
 Sequence sequenceOf(unsigned lead) {
   if (lead >= 0xc2 && lead <= 0xdf) return {2};
   if (lead >= 0xe0 && lead <= 0xef)
@@ -66,9 +66,9 @@ Character firstCharacter(std::string_view rest) {
   if (lead < 0x80) return {rest.substr(0, 1), lead, true};
   const Sequence sequence = sequenceOf(lead);
   if (sequence.length == 0) return {rest.substr(0, 1)};
-  // An invalid part ends before the first byte that cannot continue it. That byte may begin a
-  // character of its own: a text that was cut within a character and joined to another loses no
-  // more than the character that was cut.
+  // An invalid part ends before the first byte that cannot continue it, because that byte may begin
+  // a good character. So a text that was cut within a character and joined to another text loses
+  // only the character that was cut.
   char32_t point = lead & (0x7fU >> sequence.length);
   for (size_t at = 1; at < sequence.length; ++at) {
     const unsigned low = at == 1 ? sequence.lowestSecond : 0x80;
@@ -113,8 +113,8 @@ std::string replaceInvalidUtf8(std::string_view text) {
   return out;
 }
 
-// A backslash stays as it is. Escaped text is for people; whoever must tell a recorded "\x1b" from
-// an escaped one takes the JSON output.
+// A backslash stays as it is, because escaped text is for people. A reader who must tell a recorded
+// backslash from one of ours takes the JSON output.
 std::string terminalText(std::string_view text) {
   std::string out;
   appendEscaped(
@@ -148,14 +148,14 @@ std::string plainText(std::string_view text, std::string_view lineFeed) {
   return out;
 }
 
-// Three quarters of the room go to the end, since these texts are mostly paths and reasons: the end
-// of a path says more than its middle. The least maximum leaves room for both ends and the longest
-// escape.
+// Three quarters of the room go to the end of the text. Most of these texts are paths, and the end
+// of a path says more than its beginning. The cut may fall within an escape such as \x0a, which is
+// harmless: its parts are plain ASCII.
 std::string shortPlainText(std::string_view text, size_t maximum) {
   constexpr std::string_view kLeftOut = "...";
   std::string plain = plainText(text, "\\x0a");
   if (plain.size() <= maximum) return plain;
-  // The cut moves outwards to the next character, so that what is left is UTF-8 and still fits.
+  // Both cuts move away from the middle to the edge of a character: both ends stay valid UTF-8.
   const auto insideCharacter = [&](size_t at) { return (byteAt(plain, at) & 0xc0) == 0x80; };
   size_t head = maximum / 4;
   size_t tail = plain.size() - (maximum - head - kLeftOut.size());
@@ -164,8 +164,9 @@ std::string shortPlainText(std::string_view text, size_t maximum) {
   return plain.substr(0, head).append(kLeftOut).append(plain, tail);
 }
 
-// A page must not hold most controls, not even as a reference by number, so each becomes the
-// visible picture that Unicode keeps at U+2400 plus its number. The later controls have no picture.
+// HTML forbids most controls, even as a numeric reference. Unicode has a visible picture for each
+// control below U+0020, at U+2400 plus its number, so we show that. DEL and the C1 controls become
+// U+FFFD.
 std::string htmlText(std::string_view text) {
   constexpr uint32_t kControlPictures = 0x2400;
   std::string out;
@@ -192,8 +193,8 @@ std::string_view trimmed(std::string_view text, std::string_view blanks) {
   return text.substr(begin, text.find_last_not_of(blanks) - begin + 1);
 }
 
-// Commas always: the locale of whoever calls the tool must not change what a script or a test
-// compares.
+// The separator is always a comma. Scripts and tests compare this text, so the locale of the caller
+// must not change it.
 std::string grouped(uint64_t number) {
   std::string digits = std::to_string(number);
   for (size_t at = digits.size(); at > 3; at -= 3) digits.insert(at - 3, ",");

@@ -1,8 +1,8 @@
 // Text: a walk through UTF-8, and the escapes that make a text of unknown origin fit to be shown.
 //
-// Programs record what they like, and others write into the files that we read. Each such text
-// passes one of the escapes below on its way to a terminal or into markup, or that of Json.h into
-// JSON. All of them stand on one walk, so all of them agree on what is a character.
+// Programs record any text they like, and strangers may write into the files that we read. So each
+// such text is escaped on its way out: to a terminal, a log or markup by the functions below, into
+// JSON by Json.h. All of them use the same walk, so they agree on what a character is.
 //
 // Stateless; any thread.
 
@@ -22,8 +22,8 @@ struct Character {
   bool valid = false;
 };
 
-// The character that `rest` begins with. Invalid bytes come in maximal parts: as many as could
-// begin a well-formed sequence, at least one. REQUIRES: rest is not empty.
+// The character that `rest` begins with. Invalid bytes come in maximal parts: as many bytes as
+// could begin a well-formed sequence, but at least one. REQUIRES: rest is not empty.
 Character firstCharacter(std::string_view rest);
 
 // Calls `visit(const Character&)` on each character of `text`, first to last.
@@ -36,8 +36,9 @@ void forEachCharacter(std::string_view text, Visit&& visit) {
   }
 }
 
-// Appends `text` to `out`. For each character that `isPlain(const Character&)` refuses,
-// `escape(const Character&)` appends what stands in its place. Plain runs are copied whole.
+// Appends `text` to `out`. If `isPlain(const Character&)` refuses a character, then
+// `escape(const Character&)` must append its replacement. Runs of plain characters are copied
+// whole.
 template <typename IsPlain, typename Escape>
 void appendEscaped(std::string& out, std::string_view text, IsPlain&& isPlain, Escape&& escape) {
   size_t plain = 0;  // bytes of `text` that are plain and not yet copied
@@ -66,23 +67,24 @@ bool isValidUtf8(std::string_view text);
 // `text` with one U+FFFD for each maximal invalid part.
 std::string replaceInvalidUtf8(std::string_view text);
 
-// For a terminal: one line that moves no cursor, changes no colour and keeps its order. Controls
+// For a terminal: one line that moves no cursor, sets no colour and keeps its order. Controls
 // and invalid bytes become \xNN, characters that reorder or break a line become \uNNNN.
 std::string terminalText(std::string_view text);
 
-// For a log: as terminalText(), but tabs and characters that reorder a line stay, and a line feed
-// becomes `lineFeed`.
+// For a log: as terminalText(), but tabs and characters that reorder or break a line stay, and a
+// line feed becomes `lineFeed`.
 std::string plainText(std::string_view text, std::string_view lineFeed);
 
-// plainText() with a line feed as \x0a, at most `maximum` bytes of it. A text that is too long
-// loses its middle to "...". REQUIRES: maximum >= 16.
+// plainText() with line feeds as \x0a, shortened to at most `maximum` bytes: "..." takes the place
+// of the middle of a longer text. REQUIRES: maximum >= 16.
 std::string shortPlainText(std::string_view text, size_t maximum);
 
-// For markup: the content of an element or of a quoted attribute. Invalid bytes become U+FFFD;
-// controls below U+0020 become the pictures of them that Unicode has, others U+FFFD.
+// For markup: the content of an element or of a quoted attribute. A control below U+0020 becomes
+// its visible picture (U+2400 and up). Invalid bytes, other controls and characters that reorder or
+// break a line become U+FFFD.
 std::string htmlText(std::string_view text);
 
-// `text` without the blanks at either end of it.
+// `text` without the blanks at its ends.
 std::string_view trimmed(std::string_view text, std::string_view blanks = " \t\r\n");
 
 // "1,234,567".

@@ -21,8 +21,9 @@ uint64_t load(const char* at, size_t count) {
 
 }  // namespace
 
-// Each step multiplies two words of the text. A seed goes into both factors, because a factor that
-// the text alone decides could be made zero, and a product of zero forgets all the text before it.
+// Each step multiplies two words of the text. A writer who could make one factor zero would erase
+// all the text before it, because the product is then zero. So both factors are mixed with values
+// that depend on a seed.
 uint64_t hashText(std::string_view text) {
   constexpr uint64_t kOdd = 0x9e3779b97f4a7c15u;
   const auto [first, second] = hashSeeds();
@@ -82,8 +83,8 @@ void Payload::set(std::string_view key, SharedString value) {
 
 void Payload::set(std::string_view key, Number value) { store(key, value); }
 
-// Keys are searched one after the other: a payload has a few dozen at most, and a table beside the
-// list that keeps their order would cost more than it saves.
+// Keys are compared one after the other. A payload has a few dozen keys at most, so an index beside
+// the list would cost more than it saves.
 void Payload::store(std::string_view key, Value value) {
   for (Entry& entry : entries_) {
     if (entry.first == key) {

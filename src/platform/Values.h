@@ -72,11 +72,11 @@ class StringRef {
   const StringRecord* record_ = nullptr;
 };
 
-// A string that is kept, or absent.
+// An owned string, or absent.
 class SharedString {
  public:
   SharedString() = default;
-  // A record of its own for `text`; at most 4 GiB.
+  // Makes a new record for `text`, which has less than 4 GiB.
   explicit SharedString(std::string_view text) : SharedString(text, hashText(text)) {}
   // REQUIRES: hash == hashText(text).
   SharedString(std::string_view text, uint64_t hash);
@@ -126,12 +126,12 @@ class StringPool {
 
   struct Noted {
     StringRef string;
-    uint32_t& note;  // valid until the next call of either intern
+    uint32_t& note;  // valid until the next call of intern() or internNoted()
   };
 
-  // The one record of this pool for `text`, made on first sight; valid while the pool lives.
+  // This pool's only record of `text`, which the first call makes. Valid while the pool lives.
   StringRef intern(std::string_view text) { return internNoted(text).string; }
-  // The same, with a number that the pool keeps for its user beside each string, 0 at first.
+  // The same, with a number that the pool keeps beside each string for its user. It begins as 0.
   Noted internNoted(std::string_view text);
   size_t size() const { return strings_.size(); }
   // Bytes held by the texts, their records and the bookkeeping of both.
@@ -154,14 +154,14 @@ class StringPool {
 //
 // Both are plain values. A payload is completed on one thread and then shared unchanged.
 
-// A number that keeps its kind from the recording application to the event. Booleans are numbers; a
-// 32-bit float stays one; an unsigned 64-bit number never passes through a double.
+// A number that keeps its kind from the recording application to the event. Booleans are numbers. A
+// 32-bit float stays a 32-bit float, and a 64-bit integer never passes through a double.
 using Number = std::variant<bool, int64_t, uint64_t, float, double>;
 
 // False for false, 0 and 0.0; true for every other number.
 bool booleanValue(const Number& number);
-// The number as JSON has it: the shortest decimal text that reads back as the same number of its
-// kind, "true" or "false" for a boolean, "null" for a number that is not finite.
+// The number as JSON text: the shortest digits that read back as the same number of its kind,
+// "true" or "false" for a boolean, "null" for a number that is not finite.
 std::string numberText(const Number& number);
 
 // A flat dictionary: keys to strings or numbers, in the order in which the keys were first set.
@@ -171,7 +171,7 @@ class Payload {
   // Keys are literals: the views given to set() must outlive the payload.
   using Entry = std::pair<std::string_view, Value>;
 
-  // Storing an absent string leaves the key out, or as it was.
+  // Setting an absent string changes nothing: a key that has a value keeps it.
   void set(std::string_view key, SharedString value);
   void set(std::string_view key, Number value);
   // The value under `key`; null where there is none.
