@@ -1,10 +1,10 @@
 // Reading configurations and watching their files.
 //
 // A file is watched in two ways at once. inotify on its directory tells of a change within a
-// millisecond. It is blind to some: a directory that is made later, a link on the way that is
-// replaced, a file system without notifications. A look every quarter of a second finds those, and
-// costs one read of a small file. To watch every directory of the path would still miss the last
-// case, and needs far more code.
+// millisecond. It misses some changes: a directory that is made later, a link on the path that is
+// replaced, a file system without notifications. So we also look every quarter of a second, which
+// costs one read of a small file. Watching every directory of the path was discarded: it needs far
+// more code and would still miss the third kind.
 
 #include "statora/ConfigurationFiles.h"
 
@@ -33,8 +33,8 @@ namespace {
 
 using Json = nlohmann::json;
 
-// Builds the value from the parser's events, and not from a finished document, so that the depth is
-// bounded before anything is built. Each handler answers whether parsing goes on.
+// Builds the value from the parser's events. A finished document was discarded, because it would be
+// built before we could bound its depth. Each handler answers whether parsing goes on.
 class Builder final : public nlohmann::json_sax<Json> {
  public:
   bool null() override { return add({}); }
@@ -128,8 +128,8 @@ namespace {
 
 constexpr std::chrono::milliseconds kLookInterval{250};
 
-// A file that exists but cannot be read is told from a missing one: each must last for two looks by
-// itself before it counts as absence.
+// Keeps a file that cannot be read apart from a missing one. An absence needs two equal looks, so a
+// file that is replaced (unreadable, then missing, then there) is not taken for absent.
 ConfigurationFile readFile(const std::string& path) {
   auto text = readSmallFile(path, FileConfigurationService::kMaxFileBytes);
   if (text) return {true, std::move(text)};
@@ -151,24 +151,24 @@ struct Watch {
   const UniqueFd inotify{::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)};
   const UniqueFd ended{::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)};
 
-  // Watches the directory that the path leads to now. Called before every look, because the path
-  // may lead elsewhere by then. The kernel gives a directory that it already watches no second
-  // watch, and drops the watch of one that is gone.
+  // Watches the directory that the path leads to now. Called before every look, because a link on
+  // the path may have changed. A second call for the same directory adds nothing, and the kernel
+  // drops the watch of a directory that is gone.
   void watchDirectory() const {
     ::inotify_add_watch(
         inotify.get(), directory.c_str(),
         IN_CLOSE_WRITE | IN_MODIFY | IN_CREATE | IN_DELETE | IN_MOVE | IN_ATTRIB | IN_ONLYDIR);
   }
 
-  // True if something happened or `timeout` passed, false if the observer is gone. Without
-  // `heedEvents` only time counts: a burst of events must not confirm an absence too soon.
+  // True if something happened or `timeout` passed. False if the observer is gone or waiting fails.
+  // Without `heedEvents` only time counts: a burst of events must not confirm an absence too soon.
   bool wait(std::chrono::milliseconds timeout, bool heedEvents) const {
     std::array<pollfd, 2> waited{
         {{ended.get(), POLLIN, 0}, {heedEvents ? inotify.get() : -1, POLLIN, 0}}};
     if (::poll(waited.data(), waited.size(), static_cast<int>(timeout.count())) < 0 &&
         errno != EINTR)
       return false;
-    // What happened does not matter, only that something did: the look that follows tells.
+    // The events are discarded unread, because the look that follows shows what has changed.
     std::array<char, 4096> discarded{};
     while (::read(inotify.get(), discarded.data(), discarded.size()) > 0) {
     }

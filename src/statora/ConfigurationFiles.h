@@ -12,8 +12,8 @@
 
 namespace tessel {
 
-// Lists and dictionaries may be nested this deeply. The bound keeps a hostile file from exhausting
-// the stack of those who walk through the value.
+// Lists and dictionaries may be nested this deeply. Code that walks through a value recurses, so
+// without a bound a hostile file could exhaust its stack.
 inline constexpr size_t kMaxConfigurationDepth = 32;
 
 // The configuration that `text` holds. Null unless it is exactly one JSON value in UTF-8, nested no
@@ -38,14 +38,15 @@ class ConfigurationChanges {
     std::shared_ptr<const ConfigurationValue> configuration;  // null: absent
   };
 
-  // Takes a look and answers what to tell now, if anything. A configuration is told at once. Its
-  // absence is told when two looks in a row found the same, because a file that somebody is writing
-  // or replacing is no configuration for a moment.
+  // Takes the result of a look and answers what the observer is told now, if anything. A
+  // configuration is told at once. A file that somebody is writing or replacing holds no
+  // configuration for a moment, so an absence is told only after two equal looks in a row.
   std::optional<Report> look(ConfigurationFile seen);
   bool unconfirmed() const { return unconfirmed_.has_value(); }
 
  private:
-  ConfigurationFile told_;  // begins as "no file", so a file that never was is never told
+  // Begins as "no file", so the absence of a file that never existed is not told.
+  ConfigurationFile told_;
   bool absenceTold_ = false;
   std::optional<ConfigurationFile> unconfirmed_;
 };
@@ -53,14 +54,14 @@ class ConfigurationChanges {
 // Makes observers of files in one directory.
 //
 // An observer calls its delegate, on its queue, with the content of the file when observing starts
-// and again after each change. While no file has ever been there it makes no call. A configuration
-// is absent if its file went away, is no regular file, cannot be read, is over 1 MiB, or is not
-// what parseConfiguration() reads. It must be so for a quarter of a second before the delegate is
-// told.
+// and again after each change. It makes no call until the file exists for the first time. A
+// configuration is absent if its file went away, is no regular file, cannot be read, is over 1 MiB,
+// or has content that parseConfiguration() does not accept. The absence must last for a quarter of
+// a second before the delegate is told.
 //
 // Threads: one at a time calls makeObserver(), setDelegate() and startObserving(). An observer that
 // observes has a thread and two file descriptors. Dropping its last reference ends them without
-// waiting. A call that is on the queue by then still takes place and keeps the observer alive.
+// waiting. A call that is already on the queue still takes place and keeps the observer alive.
 class FileConfigurationService final : public ConfigurationService {
  public:
   static constexpr size_t kMaxFileBytes = size_t{1} << 20;

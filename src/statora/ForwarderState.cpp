@@ -6,13 +6,13 @@
 // (spool id and row id), and the backend keeps one of the two. Exactly once would need a collector
 // that remembers identifiers in a transaction with us, and none does.
 //
-// A collector may refuse a row for ever. Such a row moves to `forwarder_set_aside`, or all rows
-// behind it would wait with it. There it keeps the collector's words until somebody puts it back
-// (requeue) or newer ones push it out.
+// A collector may refuse a row for ever, and all later rows would wait behind it. So such a row
+// moves to `forwarder_set_aside`, together with the collector's words. It stays there until
+// somebody puts it back (requeue) or newer refused rows push it out.
 //
-// No transaction here flushes the disk (synchronous=NORMAL), unlike the service's. After a power
-// cut an acknowledgement may be lost; the delivery is then repeated, which at least once allows.
-// The price of a flush would fall on the service, whose sends wait for this lock.
+// Our commits do not flush the disk (synchronous=NORMAL); those of the service do. A power cut may
+// undo an acknowledgement. The row is then delivered again, which delivery at least once allows. A
+// flush here would make the service wait, because its sends need the lock that we hold meanwhile.
 
 #include "statora/ForwarderState.h"
 
@@ -29,11 +29,12 @@ namespace tessel {
 
 namespace {
 
-// The service waits 250 ms at most for a lock, so that it goes first: the forwarder has time.
+// The service gives a row up after 250 ms of waiting for the lock. The forwarder loses nothing by
+// waiting, so it waits longer.
 constexpr int kForwardersPatience = 5000;  // milliseconds
 
-// Rows of one transaction. A full batch of 512 would hold the lock four times as long, and a send
-// of the service may come at any moment.
+// Rows that one transaction removes. A send of the service may come at any moment and wait for the
+// lock. A full batch of 512 rows would hold it four times as long.
 constexpr size_t kRowsRemovedAtOnce = 128;
 
 constexpr char kTables[] =
@@ -89,8 +90,8 @@ SqliteStatus ForwarderState::open() {
   // The service renames a damaged spool and begins a new one under the old name.
   if (database_.isOpen() && isStillThere()) return {};
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
-  // Acknowledgements make the log grow, so the forwarder empties it at half the length at which the
-  // service would have to, in the middle of a send.
+  // Acknowledgements make the log grow. The service empties it at 1000 pages, in the middle of a
+  // send. The forwarder does so at half that length, to spare the service the work.
   if (status.ok())
     status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
   if (status.ok() &&
@@ -159,7 +160,7 @@ SqliteStatus ForwarderState::prepareStatements() {
   return good ? SqliteStatus{} : database_.status();
 }
 
-// The reset at the end gives the read lock back: while it is held, no checkpoint can empty the log.
+// The reset at the end gives the read lock back. No checkpoint can empty the log while we hold it.
 std::vector<SpooledEvent> ForwarderState::oldest(size_t maxRows, size_t maxBytes, int64_t after) {
   std::vector<SpooledEvent> events;
   size_t bytes = 0;
@@ -214,13 +215,13 @@ SqliteStatus ForwarderState::remove(std::span<const int64_t> ids) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
   counters_.delivered += ids.size();
-  // The position never goes back: rows that were set aside and requeued have lower ids.
+  // Requeued rows have ids below the position. The maximum keeps it from going back.
   counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
   SqliteStatus status =
       finish(std::all_of(ids.begin(), ids.end(),
                          [this](int64_t id) { return remove_.bind(1, id).run(); }) &&
              writeCounters());
-  // The rows are still there, so they are not delivered.
+  // The rollback has kept the rows, so they must not count as delivered.
   if (!status.ok()) counters_ = before;
   return status;
 }
@@ -234,7 +235,7 @@ SqliteStatus ForwarderState::setAside(const SpooledEvent& event, int64_t collect
   bool good = keep_.run() && remove_.bind(1, event.id).run() &&
               trim_.bind(1, static_cast<int64_t>(maxSetAside_)).run();
   if (good) {
-    // The last statement was the trimming, and what it removed is lost for good.
+    // changes() tells of the last statement, the trimming. The rows that it deleted are lost.
     counters_.setAsideDropped += static_cast<uint64_t>(database_.changes());
     ++counters_.setAside;
     good = writeCounters();
@@ -249,7 +250,8 @@ SqliteStatus ForwarderState::storeCounters() {
   return finish(writeCounters());
 }
 
-// The rows keep their ids. They are lower than those that wait, so they go out first.
+// The rows keep their ids, so the collector sees the same identifiers again. Their ids are mostly
+// lower than those of the rows that wait, so they mostly go out first.
 std::optional<int64_t> ForwarderState::requeue() {
   const SqliteStatus status = database_.execute(
       "BEGIN IMMEDIATE;"
@@ -257,14 +259,14 @@ std::optional<int64_t> ForwarderState::requeue() {
       "forwarder_set_aside;");
   const int64_t rows = database_.changes();
   const bool good = status.ok() && database_.execute("DELETE FROM forwarder_set_aside").ok();
-  // Both statements saw the same rows, being of one transaction.
+  // One transaction copied and deleted the rows, so nobody can have added or removed one between.
   TESSEL_INVARIANT(!good || database_.changes() == rows);
   if (!finish(good).ok()) return {};
   return rows;
 }
 
-// SQLite reuses the pages of removed rows but never makes the file shorter by itself. A VACUUM
-// would copy the whole file under the lock; this moves a few pages.
+// SQLite reuses the pages of removed rows, but in this mode it shortens the file only when asked. A
+// VACUUM would copy the whole file under the lock. An incremental one moves only a few pages.
 bool ForwarderState::shrink(int pages) {
   if (database_.integer("PRAGMA freelist_count").value_or(0) == 0) return false;
   SqliteStatement vacuum =

@@ -3,7 +3,8 @@
 // A row stays in `events` until a collector has taken it. The forwarder adds two tables:
 //
 //   forwarder            name and value of each counter
-//   forwarder_set_aside  the rows that a collector refused, with the time, its status and its words
+//   forwarder_set_aside  the rows that cannot be delivered, each with the time of the refusal and
+//                        the collector's status and words (status 0: no collector was asked)
 //
 // Threads: one at a time.
 
@@ -31,9 +32,9 @@ struct SpooledEvent {
 // What the forwarder has done with this spool since the spool was made.
 struct ForwarderCounters {
   uint64_t delivered = 0;        // records that a collector took, including rejected ones
-  uint64_t rejected = 0;         // of the delivered ones: rejected in a partial success
+  uint64_t rejected = 0;         // of the delivered ones: those that the collector threw away
   uint64_t setAside = 0;         // records that were refused and set aside
-  uint64_t setAsideDropped = 0;  // of these: the oldest, given up to stay within the limit
+  uint64_t setAsideDropped = 0;  // of the set aside ones: the oldest, deleted to keep the limit
   uint64_t requests = 0;
   uint64_t retries = 0;
   uint64_t bytesSent = 0;    // of request bodies, as sent
@@ -66,7 +67,7 @@ class ForwarderState {
   // Empty if that fails; status() then says why.
   std::vector<SpooledEvent> oldest(size_t maxRows, size_t maxBytes, int64_t after = 0);
   SqliteStatus status() const { return database_.status(); }
-  // About how many rows wait: the span of their ids, because counting would read the whole table.
+  // About how many rows wait. It is the span of their ids, because counting would read the table.
   uint64_t waiting();
 
   // The counters. The next acknowledgement or setting aside stores them.
@@ -74,14 +75,14 @@ class ForwarderState {
   // Counts the rows as delivered and removes them, in transactions of a few rows each. If it fails,
   // the rows of the finished transactions are gone and counted, and the others wait. `ids` ascend.
   SqliteStatus acknowledge(std::span<const int64_t> ids, Date now);
-  // Moves a row to the table of refused ones, with the collector's answer. Beyond the limit the
-  // oldest refused row is given up.
+  // Moves a row to the table of refused rows, with the collector's answer. If the table then has
+  // more rows than the limit, its oldest row is deleted.
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
                         Date now);
   // Stores the counters alone.
   SqliteStatus storeCounters();
-  // Puts all rows that were set aside back among those that wait. The number of rows; absent if it
-  // fails, and then nothing has changed.
+  // Puts all rows that were set aside back among those that wait, and answers their number. If that
+  // fails, the answer is absent and nothing has changed.
   std::optional<int64_t> requeue();
   // Gives up to `pages` pages of free space back to the file system. False if there was none.
   bool shrink(int pages);

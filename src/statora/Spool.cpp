@@ -2,18 +2,17 @@
 //
 // The choice. Every send is one transaction in SQLite's write-ahead log mode with synchronous=FULL:
 // the commit appends the row to the log and flushes the log before it returns.
-//  - A kill at any moment loses nothing that was sent. The kernel holds what was written, and the
-//    next one to open the spool drops a transaction without its commit.
+//  - A kill at any moment loses nothing that was sent. The kernel keeps the written pages, and
+//    SQLite drops an unfinished transaction when the spool is next opened.
 //  - A power cut loses nothing that was sent, because of the flush. With synchronous=NORMAL it
 //    could lose every row since the last checkpoint, though the file would stay sound.
 // The price is one flush a send: about 0.1 ms on flash, half of it processor time. The service
 // sends at most 80 events a second, so even a disk that needs 10 ms for a flush keeps up.
 //
 // What was discarded. The rollback journal (SQLite's default mode) flushes several times a commit,
-// and a reader makes the writer wait. Flushing every second send, or at the end of a run, would do
-// for what the service promises; but then the last row would be less safe than the others, and the
-// bookkeeping costs more than the flush. A plain file of lines could not give space back while the
-// service appends to it.
+// and a reader makes the writer wait. One flush for several sends would be cheaper, but "true" from
+// a send would then not mean that its row is safe, and keeping track of the unsafe rows costs more
+// than the flush. A plain file of lines could not give space back while the service appends to it.
 
 #include "statora/Spool.h"
 
@@ -40,8 +39,8 @@ namespace {
 // Step N brings a spool of version N to version N + 1. A step only adds, so that a forwarder of the
 // version before can still deliver the rows.
 //
-// AUTOINCREMENT never gives an id twice, even after its row was delivered and removed. The
-// forwarder relies on it: spool_id and id together name one event for ever.
+// AUTOINCREMENT never gives an id twice, even after the row was delivered and removed. The
+// forwarder needs that, because spool_id and id together are the identifier of an event.
 constexpr const char* kUpgrades[] = {
     "CREATE TABLE events(id INTEGER PRIMARY KEY AUTOINCREMENT, time INTEGER NOT NULL,"
     " name TEXT NOT NULL, payload TEXT NOT NULL);"
@@ -67,10 +66,11 @@ SqliteStatus upgrade(SqliteDatabase& database) {
 }
 
 // The forwarder is another user of the same group and must write to the spool. SQLite would make
-// the file without write permission for the group; its log and its index get the mode of this file.
+// the file without write permission for the group, so we make it first. SQLite then gives the log
+// and the index of the log the same mode.
 //
-// Only a file that is not there yet is opened here. Closing any descriptor of a file drops all
-// locks that the process holds on it (POSIX), and so the locks of a database that is already open.
+// This never opens an existing file. When a process closes any descriptor of a file, POSIX drops
+// all its locks on that file, and an open database would lose its locks in that way.
 void makeFile(const std::string& path) { createNewFile(path, 0660); }
 
 SqliteStatus prepareSchema(SqliteDatabase& database) {
@@ -80,8 +80,8 @@ SqliteStatus prepareSchema(SqliteDatabase& database) {
   if (*version > kSpoolSchemaVersion || *version < 0) {
     return {SQLITE_SCHEMA, "made by another version (schema " + std::to_string(*version) + ")"};
   }
-  // auto_vacuum lets the forwarder give the space of delivered rows back in small steps. It has no
-  // effect once a table exists, so it comes first.
+  // auto_vacuum lets the forwarder give the space of delivered rows back in small steps. It can
+  // only be set before the first table exists, so it comes first.
   SqliteStatus status = database.execute("PRAGMA auto_vacuum=INCREMENTAL; PRAGMA journal_mode=WAL");
   return status.ok() ? upgrade(database) : status;
 }
@@ -95,22 +95,22 @@ SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path
   if (!status.ok()) return status;
   database.setBusyTimeout(busyTimeoutMilliseconds);
   status = prepareSchema(database);
-  // A spool of a newer version must stay as it is; closing it normally would move its log.
+  // A spool of a newer version must stay as it is. A normal close would write its log back.
   if (!status.ok()) database.abandon();
   return status;
 }
 
 namespace {
 
-// How long one send may wait for another client's lock. The forwarder and readers hold theirs for a
-// fraction of it. After a wait in vain the sends do not wait until one works again: with a lock
-// that stays, thousands of events would each add this time to the run.
+// How long one send may wait for another client's lock. The forwarder holds its locks for a
+// fraction of that. After one wait that failed, the next sends do not wait at all, until one of
+// them succeeds. Otherwise a lock that stays would add this time to the run for each event.
 constexpr int kPatienceMilliseconds = 250;
-// The log is moved into the database whenever it has this many pages (4 MB). A longer log would
-// slow down every reader, who has to look through it.
+// The log is moved into the database whenever it has this many pages (4 MB). Every reader has to
+// look through the log, so a longer one would slow all readers down.
 constexpr int kCheckpointPages = 1000;
-// The part of the limit that the log may take. It grows beyond kCheckpointPages only while a reader
-// keeps it from being emptied.
+// The log may take one part in so many of the limit. It grows beyond kCheckpointPages only while a
+// reader keeps it from being emptied.
 constexpr uint64_t kLogShare = 16;
 constexpr int64_t kUsualPageSize = 4096;
 
@@ -127,15 +127,15 @@ bool isDamage(const SqliteStatus& status) {
   return status.primaryCode() == SQLITE_CORRUPT || status.primaryCode() == SQLITE_NOTADB;
 }
 
-// After these SQLite may go on answering from what it holds of a file that changed below it, so the
-// next send opens the database anew.
+// After these errors the file may have changed below SQLite, which would still answer from its
+// cache. So the next send opens the database anew.
 bool needsReopening(const SqliteStatus& status) {
   return status.primaryCode() == SQLITE_IOERR || status.primaryCode() == SQLITE_READONLY ||
          status.primaryCode() == SQLITE_CANTOPEN;
 }
 
-// The log is renamed first. Died in between, the process would otherwise leave a log without its
-// database, and SQLite would play it into the new one.
+// The log is renamed first. If the database went first and the process died then, the log would
+// stay alone under the old name, and SQLite would play it into the new database.
 bool renameAll(const std::string& from, const std::string& to) {
   for (const char* suffix : {"-wal", "", "-shm"}) {
     std::error_code error;
@@ -177,7 +177,7 @@ bool Spool::sendEvent(std::string_view name, const Payload& payload) {
     recordFailure(status, validName.size() + text.size());
     if (needsReopening(status)) close();
   }
-  // The run's record says what became of every send; none may be missing or counted twice.
+  // The run's record accounts for every send, so none may be missing or counted twice.
   TESSEL_INVARIANT(figures_.stored + std::accumulate(figures_.failed.begin(), figures_.failed.end(),
                                                      uint64_t{0}) ==
                    figures_.sent);
@@ -216,7 +216,7 @@ SqliteStatus Spool::open() {
   const int64_t pageSize = database_.integer("PRAGMA page_size").value_or(kUsualPageSize);
   maxLogPages_ = std::max<int64_t>(static_cast<int64_t>(maxBytes_ / kLogShare) / pageSize, 16);
   maxPages_ = std::max<int64_t>(static_cast<int64_t>(maxBytes_) / pageSize - maxLogPages_, 1);
-  // A limit below the present size is safe: SQLite then only stops the database from growing.
+  // A limit below the present size is safe: SQLite then only keeps the database from growing.
   // journal_size_limit cuts the log file down after a reader let it grow.
   status = database_.execute(
       "PRAGMA synchronous=FULL; PRAGMA max_page_count=" + std::to_string(maxPages_) +
@@ -234,8 +234,8 @@ void Spool::close() {
 }
 
 // SQLite calls this after each commit, with the number of pages in the log. It replaces SQLite's
-// own automatic checkpoint. PASSIVE moves what it can without waiting for a reader, and is tried
-// again at the next commit.
+// own automatic checkpoint. A PASSIVE checkpoint waits for no reader: it moves the pages that no
+// reader needs, and the next commit tries the rest.
 int Spool::afterCommit(void* spool, sqlite3* handle, const char* schema, int logPages) {
   static_cast<Spool*>(spool)->logPages_ = logPages;
   if (logPages >= std::min<int64_t>(kCheckpointPages, static_cast<Spool*>(spool)->maxLogPages_)) {
@@ -245,8 +245,9 @@ int Spool::afterCommit(void* spool, sqlite3* handle, const char* schema, int log
 }
 
 // A client that never ends its read transaction keeps every checkpoint from finishing, and the log
-// grows by several pages an event. Past its share of the limit the sends are refused, until
-// TRUNCATE, which needs the log for itself, works again.
+// grows by several pages an event. Once the log has used up its share, each send is refused until a
+// TRUNCATE checkpoint succeeds. That one needs the log for itself, so it fails while the reader
+// stays.
 bool Spool::logIsTooLong() {
   if (logPages_ <= maxLogPages_) return false;
   database_.setBusyTimeout(0);
@@ -293,11 +294,12 @@ SpoolFailure Spool::classify(const SqliteStatus& status, size_t rowBytes) {
     default:
       return SpoolFailure::other;
   }
-  // Until the database was opened once, no limit is set that could have been reached.
+  // If the database was never opened, no page limit is set, so the disk must be full.
   if (maxPages_ == 0) return SpoolFailure::diskFull;
   if (logPages_ > maxLogPages_) return SpoolFailure::limit;
-  // SQLite has one code for its page limit and for a full disk. It was the limit if the row did not
-  // fit below it: its overflow pages, and 8 more for the pages of the tree that may split.
+  // SQLite has the same code for its page limit and for a full disk. It was the limit if the row
+  // would not have fitted below it. A row needs its overflow pages, and up to 8 more where pages of
+  // the tree split.
   const int64_t pages = database_.integer("PRAGMA page_count").value_or(0);
   const int64_t needed = static_cast<int64_t>(rowBytes) / kUsualPageSize + 8;
   return pages + needed > maxPages_ ? SpoolFailure::limit : SpoolFailure::diskFull;

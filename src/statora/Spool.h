@@ -34,7 +34,7 @@ enum class SpoolFailure {
   diskFull,  // no space or no quota is left
   readOnly,  // the file cannot be opened or written
   locked,    // another client keeps it locked
-  damaged,   // and could not be set aside, or one was set aside already in this run
+  damaged,   // it is damaged, and renaming it failed or was already done once in this run
   version,   // another version of the schema made it
   other,
 };
@@ -43,7 +43,7 @@ inline constexpr size_t kSpoolFailureKinds = 7;
 // "limit", "disk_full", "read_only", "locked", "damaged", "version", "other".
 const char* spoolFailureName(SpoolFailure failure);
 
-// What became of the sends since the run began: each is either stored or has failed for one reason.
+// The results of the sends since the run began. Each send was stored or failed for one reason.
 struct SpoolFigures {
   uint64_t sent = 0;
   uint64_t stored = 0;
@@ -53,21 +53,21 @@ struct SpoolFigures {
 
 // The event sender of the analytics service.
 //
-// A row is past a power cut as soon as its own sendEvent() has returned true. The first send opens
-// the database, so a run that sends nothing leaves no file. endRun() closes it, so the next run
-// notices that somebody moved or removed it.
+// Once sendEvent() has returned true, its row survives a power cut. The first send opens the
+// database, so a run that sends nothing makes no file. endRun() closes the database. The next run
+// opens it by its path, so it does not write to a file that somebody has moved or removed.
 //
-// A send that fails is counted under its reason and the run goes on; the log says each reason once
+// A send that fails is counted under its reason, and the run goes on. The log says each reason once
 // a run. A damaged spool is renamed to `statora.db.damaged-<UTC date>`, at most once a run, and a
-// new one is begun. Nothing ever rewrites what was stored.
+// new one is begun. The service never changes a stored row.
 //
 // Threads: one at a time (the reporting queue).
 class Spool final : public EventSender {
  public:
   static constexpr uint64_t kDefaultMaxBytes = uint64_t{1} << 30;
 
-  // The database lies in `stateDirectory`, which the first send makes. `maxBytes` bounds the
-  // database and its write-ahead log together; a sixteenth of it is for the log.
+  // The database lies in `stateDirectory`, which the first send makes if it is missing. `maxBytes`
+  // bounds the database and its write-ahead log together. The log may take a sixteenth of it.
   Spool(std::string stateDirectory, Clock& clock, uint64_t maxBytes = kDefaultMaxBytes);
 
   bool sendEvent(std::string_view name, const Payload& payload) override;
@@ -96,10 +96,10 @@ class Spool final : public EventSender {
 
   SqliteDatabase database_;
   SqliteStatement insert_;
-  int64_t maxPages_ = 0;  // of the database; 0 until it was opened
+  int64_t maxPages_ = 0;  // of the database; 0 until it was opened once
   int64_t maxLogPages_ = 0;
   int64_t logPages_ = 0;    // in the write-ahead log, after the last commit
-  bool impatient_ = false;  // the last wait for a lock was in vain, so the next send does not wait
+  bool impatient_ = false;  // the last wait for a lock failed, so the next send does not wait
   SpoolFigures figures_;
 };
 

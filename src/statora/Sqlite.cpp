@@ -1,7 +1,8 @@
 // SQLite with its errors as values.
 //
-// A thin layer: it owns handles and statements and turns codes into SqliteStatus. SQL stands where
-// it is used, because the spool's statements are few and their meaning lies in their order.
+// A thin layer: it owns handles and statements and turns result codes into SqliteStatus. It knows
+// no SQL of the spool. Those statements are few, and their order matters, so they stand in their
+// users.
 
 #include "statora/Sqlite.h"
 
@@ -62,7 +63,8 @@ std::string_view SqliteStatement::text(int column) const {
 
 namespace {
 
-// Only a URI can say "immutable". In a path these three characters would have a meaning in it.
+// SQLite takes "immutable" only from a URI. The characters %, ? and # have a meaning in a URI, so
+// those of the path are escaped.
 std::string immutableUri(const std::string& path) {
   std::string uri = "file:";
   for (const char character : path) {
@@ -134,7 +136,7 @@ std::optional<std::string> SqliteDatabase::text(std::string_view query) {
 }
 
 SqliteStatus SqliteDatabase::status() const {
-  // SQLite answers without a handle only if it cannot allocate one.
+  // Opening gives a handle even if it fails, unless there is no memory for the handle.
   if (handle_ == nullptr) return {SQLITE_NOMEM, "out of memory"};
   const int code = sqlite3_extended_errcode(handle_);
   if (code == SQLITE_OK || code == SQLITE_ROW || code == SQLITE_DONE) return {};

@@ -1,7 +1,7 @@
 // SQLite with its errors as values.
 //
-// Threads: one thread at a time uses a database and its statements. Statements go before their
-// database is closed.
+// Threads: one thread at a time uses a database and its statements. Destroy the statements before
+// their database is closed.
 
 #pragma once
 
@@ -16,8 +16,8 @@ struct sqlite3_stmt;
 
 namespace tessel {
 
-// How an operation ended: SQLite's extended result code (0: well), and the reason in words if it
-// failed.
+// How an operation ended: SQLite's extended result code, 0 for success, and the reason of a failure
+// in words.
 struct SqliteStatus {
   int code = 0;
   std::string reason;
@@ -58,7 +58,7 @@ class SqliteStatement {
 class SqliteDatabase {
  public:
   // `immutable` reads the file as it stands, without its write-ahead log, and makes no files beside
-  // it. It is for a user who may only read, while nobody writes.
+  // it. It serves a user without write permission, and is right only while nobody writes.
   enum class Mode { readOnly, readWrite, create, immutable };
 
   SqliteDatabase() = default;
@@ -85,7 +85,7 @@ class SqliteDatabase {
   SqliteStatus status() const;
   // How long an operation may wait for another client's lock.
   void setBusyTimeout(int milliseconds);
-  // The rows that the last INSERT or DELETE changed.
+  // How many rows the last INSERT or DELETE changed.
   int64_t changes() const;
   sqlite3* handle() const { return handle_; }
 
