@@ -1,7 +1,7 @@
 // Reading the launch variables.
 //
-// A value without sense ends the process before it has done anything. To go on with the default was
-// discarded: an operator who mistypes an interval would learn of it from missing data, weeks later.
+// An invalid value ends the process before it has done anything. Going on with the default was
+// discarded: an operator who mistypes an interval would notice it weeks later, from missing data.
 
 #include "linux/LaunchConfiguration.h"
 
@@ -15,7 +15,7 @@ namespace tessel {
 
 namespace {
 
-// A year. A longer wait is a typing mistake, and sums of such times are far from overflow.
+// A year. A longer wait is surely a typing mistake, and sums of such times cannot overflow.
 constexpr int64_t kMaxSeconds = 31'536'000;
 constexpr size_t kMaxQuotedValue = 256;  // so that the error stays one readable line
 constexpr std::string_view kBlanks = " \t";

@@ -1,5 +1,5 @@
-// LaunchConfiguration: what the environment says about this process. It is read once, before
-// anything is started. A plain value; any thread.
+// LaunchConfiguration: the settings that the environment gives this process. It is read once,
+// before anything is started. A plain value; any thread.
 
 #pragma once
 
@@ -15,7 +15,7 @@
 namespace tessel {
 
 // Exit statuses of the service besides 0, as in sysexits.h.
-inline constexpr int kExitConfiguration = 78;   // a launch variable has a value without sense
+inline constexpr int kExitConfiguration = 78;   // a launch variable has an invalid value
 inline constexpr int kExitStateDirectory = 73;  // the state directory cannot be used
 
 // What may defer a run.
@@ -41,11 +41,11 @@ struct LaunchConfiguration {
   std::string osReleasePath = "/etc/os-release";
 };
 
-// A variable whose value makes no sense.
+// A variable with an invalid value.
 struct LaunchError {
   std::string variable;
   std::string value;
-  std::string expected;  // what would make sense
+  std::string expected;  // which values are valid
 
   // One line that names variable and value. It has no line feed and is fit for a terminal.
   std::string line() const;
@@ -54,8 +54,8 @@ struct LaunchError {
 // The value of an environment variable. Absent if it is not set.
 using EnvironmentReader = std::function<std::optional<std::string>(const std::string& name)>;
 
-// Reads every launch variable. The error is the first one that makes no sense. Touches nothing but
-// the reader.
+// Reads every launch variable. The error is the first variable with an invalid value. Touches
+// nothing but the reader.
 std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
     const EnvironmentReader& environment);
 

@@ -1,9 +1,9 @@
 // The journal and standard error as log sinks.
 //
 // A log line must arrive whatever else fails, so neither sink keeps a file, a lock or a buffer. A
-// message that the journal refuses (the daemon is not there, or its disk is full) goes to standard
-// error, which the service manager keeps as well. What that refuses too is lost without a further
-// attempt: a run is worth more than its log.
+// message that cannot be sent to the journal (nobody listens on its socket, for example) goes to
+// standard error, which the service manager keeps as well. If that fails too, the message is lost:
+// a run is worth more than its log.
 
 #define SD_JOURNAL_SUPPRESS_LOCATION  // every line is sent from this file
 
@@ -20,9 +20,9 @@ namespace tessel {
 
 namespace {
 
-// The lines that packaging/systemd/tessel.catalog explains, by their beginnings. An entry carries
-// the identifier, and `journalctl -x` then shows the explanation. A test of the packages holds this
-// table against the catalog.
+// The lines that packaging/systemd/tessel.catalog explains, by their beginnings. Their entries
+// carry the identifier, by which `journalctl -x` finds the explanation. A test of the packages
+// compares this table with the catalog.
 constexpr struct {
   std::string_view beginning;
   std::string_view id;  // 32 hexadecimal digits

@@ -31,8 +31,9 @@ class StderrLog final : public LogSink {
   const int fd_;
 };
 
-// Writes one journal entry per message and leaves the text as it is. A message that the journal
-// does not take goes to standard error.
+// Writes one journal entry per message and leaves the text as it is. A message that cannot be sent
+// goes to standard error. If the journal's socket does not exist at all, libsystemd reports success
+// and the message is lost; makeLogSink() chooses this sink then only if it is told to.
 class JournalLog final : public LogSink {
  public:
   explicit JournalLog(std::string_view program = {}) : fallback_(program) {}
@@ -44,7 +45,8 @@ class JournalLog final : public LogSink {
 };
 
 // The fields of one message's journal entry, each NAME=value. The category is the identifier that
-// `journalctl -t` looks for. No field is one of a trace point, so a log line is never read as one.
+// `journalctl -t` looks for. None of the fields belongs to a trace point, so a log line is never
+// read as a trace point.
 std::vector<std::string> journalFields(LogLevel level, std::string_view subsystem,
                                        std::string_view category, std::string_view text);
 

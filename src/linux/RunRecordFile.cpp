@@ -20,12 +20,13 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-// Sixteen times what we write at most, so that a record of a later service can be read, and a file
-// that somebody put there cannot fill the memory.
+// Our records have a sixteenth of this at most, so a larger one of a later service can still be
+// read. The bound keeps a file that somebody else put there from filling the memory.
 constexpr size_t kMaxRecordBytes = size_t{1} << 20;
 constexpr size_t kMaxFailureBytes = 1024;
-// Three codes tell up to 17 places apart and escaping doubles a text at most: 51 losses of two such
-// texts, with their keys, are 60 KiB.
+// Losses of three codes (skipped files, damage, dropped entries) vary without bound, so each of
+// these codes may list 17. JSON escapes double a text at most. So 51 losses with two such texts
+// each take 60 KiB with their keys.
 constexpr size_t kMaxTextBytes = 256;
 
 std::string recordPath(const std::string& stateDirectory) {
@@ -38,7 +39,7 @@ Date dateAt(const Json& json, const char* key) {
 
 uint64_t countAt(const Json& json, const char* key) { return json.at(key).get<uint64_t>(); }
 
-// Names that this version does not know make a record that cannot be understood.
+// A name that this version does not know makes the record one that cannot be understood.
 template <typename Value>
 Value required(std::optional<Value> value) {
   if (!value) throw Json::other_error::create(501, "unknown name", nullptr);
@@ -61,9 +62,9 @@ Loss lossFrom(const Json& json) {
   return loss;
 }
 
-// Texts are cut and made plain only here, at the edge: the list in memory keeps them as they were.
-// Two paths that were cut to the same text become one loss when the record is read, with the sum of
-// both counts.
+// Texts are shortened and made plain only here; the list in memory keeps them unchanged. Two long
+// paths may become the same text. A reader of the record then sees one loss with the sum of both
+// counts.
 void addLoss(JsonWriter& json, const Loss& loss) {
   json.member("code", lossName(loss.code)).member("count", loss.count);
   json.member("words", shortPlainText(loss.words, kMaxTextBytes));
@@ -96,12 +97,12 @@ StoreReading readingFrom(const Json& json) {
   return reading;
 }
 
-// An older service kept sums by kind under the same key, and no list of losses.
+// An older service kept sums by kind under the key "reading", and no list of losses.
 bool hasReading(const Json& json) {
   return json.contains("reading") && !json.at("reading").contains("malformed");
 }
 
-// Throws where a member is missing or of the wrong kind.
+// Throws if a member is missing or has the wrong kind.
 RunRecord recordFrom(const Json& json) {
   RunRecord record;
   record.start = dateAt(json, "start");
@@ -126,7 +127,7 @@ RunRecord recordFrom(const Json& json) {
 
 std::optional<PlatformError> writeRunRecord(const RunRecord& record,
                                             const std::string& stateDirectory) {
-  // A run that was not tasked read nothing and must not replace the record of one that did.
+  // A run that was not tasked read nothing, so it must not replace the record of a run that did.
   TESSEL_INVARIANT(record.outcome != RunOutcome::notTasked);
   std::string text;
   JsonWriter json(text, {.indent = 1});
@@ -154,7 +155,7 @@ std::optional<RunRecord> readRunRecord(const std::string& stateDirectory) {
   try {
     return recordFrom(Json::parse(*text));
   } catch (const nlohmann::json::exception&) {
-    // Half a record would show books that do not balance, so a damaged one is taken for none.
+    // Half a record would show books that do not balance, so a damaged record counts as none.
     return {};
   }
 }

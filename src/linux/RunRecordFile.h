@@ -12,14 +12,14 @@
 
 namespace tessel {
 
-// Replaces the record in the state directory. The file stays below 64 KiB whatever the store looked
-// like, because the list of losses is bounded and long texts lose their middle. Absent if that
-// succeeded. REQUIRES: the run was tasked.
+// Replaces the record in the state directory. The file stays below 64 KiB whatever the store holds,
+// because the list of losses is bounded and long texts lose their middle. The error is absent if
+// that succeeded. REQUIRES: the run was tasked.
 std::optional<PlatformError> writeRunRecord(const RunRecord& record,
                                             const std::string& stateDirectory);
 
-// Nothing where there is no record or it cannot be understood. A record that an older service left
-// has no reading.
+// The last record. Absent if there is none or it cannot be understood. `reading` is absent in a
+// record of an older service that kept it in another form.
 std::optional<RunRecord> readRunRecord(const std::string& stateDirectory);
 
 }  // namespace tessel

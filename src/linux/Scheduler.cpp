@@ -1,15 +1,18 @@
 // Deferral by file, battery and CPU pressure; deliveries to the activity.
 //
-// Several processes may use one state directory: the timer's, a second service, an operator's. Two
-// things keep them apart, a lock and a record.
+// Several processes may use one state directory: that of the timer, a second service, one that an
+// operator started. A lock and a record keep them apart.
 //  - A run is delivered under an exclusive flock() on the directory. The kernel drops it when the
-//    process dies, however it dies. A lock file with a process id was discarded: after a kill it
-//    stays, and the id may by then be another process's.
-//  - The record says when the last run began. A run is due when that is an interval ago. Who waited
-//    for the lock looks at the record again, because the run may have taken place meanwhile.
-// The begin counts and not the end, so that runs keep their distance however long one takes. The
-// record is written after the run: a run that dies is not recorded, and the next process repeats it
-// (the run marker then says so). Writing it before would skip a day after each crash.
+//    process dies, however it dies. A lock file with a process id was discarded: the file stays
+//    after a kill, and the id may then belong to another process.
+//  - The record says when the last run began. A run is due when that is an interval ago. While a
+//    process waits for the lock, another one may run, so it then reads the record again.
+// The begin counts and not the end, so that runs keep their distance however long each takes.
+//
+// The record is written after the run, so a run that dies is not recorded. The next process then
+// starts a run at once, which finds the marker of the dead run, reads nothing and is recorded. The
+// next full run comes an interval later. If the record were written first, one more interval would
+// pass without a run.
 //
 // The wall clock may jump and the machine may sleep. No single wait therefore exceeds a minute,
 // after which both clocks are read again.
@@ -37,7 +40,7 @@ namespace {
 constexpr size_t kMaxFactSize = 4096;  // the kernel writes files of this kind into one page
 // Below this most desktops warn of a low battery.
 constexpr int kLowBatteryPercent = 20;
-// Tasks waited for the CPU in 80 of 100 moments of the last ten seconds. A run would lengthen them.
+// For 80 % of the last ten seconds some task waited for the CPU. A run would lengthen such waits.
 constexpr double kHighPressurePercent = 80;
 
 // The content of a one-line file. Empty if there is none.
@@ -71,8 +74,8 @@ bool feedsTheMachine(const std::string& supply) {
          fact(supply + "/present") != "0";
 }
 
-// The number behind "avg10=" in the line "some". The line "full" has an average, too, but it stays
-// at zero for the CPU of a whole machine.
+// The number behind "avg10=" in the line "some". The line "full" has such a number too, but for the
+// CPU of a whole machine it is always zero.
 std::optional<double> someAverage10(std::string_view text) {
   constexpr std::string_view kBefore = "some avg10=";
   const size_t at = text.starts_with(kBefore) ? 0 : text.find("\nsome avg10=");
@@ -98,13 +101,13 @@ std::optional<std::string> DeferralConditions::reason() const {
 }
 
 bool DeferralConditions::deferFileExists() const {
-  // lstat, so that a link that leads nowhere defers as well.
+  // lstat, because a broken link counts as the file too.
   struct stat facts {};
   return ::lstat(deferFile_.c_str(), &facts) == 0;
 }
 
-// A machine with several batteries empties one after another, so its charge is low only if all of
-// them are.
+// A machine with several batteries empties one after another. So the machine is low on charge only
+// if all its batteries are low.
 bool DeferralConditions::batteryIsLow() const {
   bool discharging = false;
   for (const std::string& supply : entriesOf(powerSupplyDirectory_)) {
@@ -123,11 +126,12 @@ bool DeferralConditions::cpuIsUnderPressure() const {
 
 namespace {
 
-// The longest single wait. The wall clock and the time that the machine slept are read this often.
+// The longest single wait. A wait does not notice that the wall clock was set or that the machine
+// slept, so both clocks are read again this often.
 constexpr std::chrono::nanoseconds kLongestWait = std::chrono::minutes{1};
 
-// One delivery to the activity. The service asks from several threads, hence the lock. After end()
-// the delivery takes no state, because nobody would act on it.
+// One delivery to the activity. Several threads of the service use it, hence the lock. After end()
+// it takes no state any more, because nobody would act on it.
 class Delivery final : public Activity {
  public:
   Delivery(int64_t state, const DeferralConditions& conditions)
@@ -144,7 +148,7 @@ class Delivery final : public Activity {
     state_ = wanted;
     return true;
   }
-  // Takes no state from here on. True if the run was deferred.
+  // Makes every later setState() fail. True if the run was deferred.
   bool end() {
     const std::lock_guard lock(mutex_);
     over_ = true;
@@ -172,7 +176,8 @@ BackgroundScheduler::BackgroundScheduler(ScheduleCriteria criteria, const StateD
       clock_(clock) {}
 
 void BackgroundScheduler::registerActivity(const std::string& /*name*/, ActivityHandler handler) {
-  // The process may not end while a delivery is pending; the thread holds that until it ends.
+  // The process must not end while a delivery is pending. `pending` keeps it alive until the thread
+  // ends.
   std::thread([pending = runtime_.expectDelivery(),
                deliveries = ActivityDeliveries(criteria_, state_, conditions_, status_, clock_,
                                                std::move(handler))]() mutable {
@@ -204,7 +209,7 @@ bool ActivityDeliveries::deliverRun() {
   const auto delivery = std::make_shared<Delivery>(kActivityStateRun, conditions_);
   handler_(delivery);
   if (delivery->end()) {
-    // Give the lock back before the wait: another process may have a better moment.
+    // Give the lock back before the wait, so that another process can run meanwhile.
     turn.reset();
     status_.say("run deferred: " + conditions_.reason().value_or("no reason any more"));
     waitForRetry();
@@ -224,7 +229,7 @@ RunLock ActivityDeliveries::waitForTurn() {
     } else if (!criteria_.interval || lastRun() == lastRunSeen) {
       return std::move(*turn);
     }
-    // Otherwise another process ran while this one waited for the lock, and its run is not due.
+    // Otherwise another process ran while we waited for the lock, so our run is no longer due.
   }
 }
 
@@ -234,8 +239,8 @@ std::optional<RunLock> ActivityDeliveries::waitForLock() {
   return state_.waitForLock();
 }
 
-// Answers the last run on which the decision rests. Whoever gets the lock then sees whether that is
-// still the last run.
+// Answers the last run that it has seen. Once the caller has the lock, it compares: a later run
+// means that ours is no longer due.
 std::optional<Date> ActivityDeliveries::waitUntilDue() {
   const std::optional<Date> seen = lastRun();
   if (!criteria_.interval) return seen;
@@ -249,8 +254,8 @@ std::optional<Date> ActivityDeliveries::waitUntilDue() {
   }
 }
 
-// The record, or a later run of this process. A directory that cannot be written must not make the
-// service run again and again.
+// The recorded run, or a later one of this process. If the directory cannot be written, the record
+// stays old, and without lastRunHere_ the service would run again and again.
 std::optional<Date> ActivityDeliveries::lastRun() const {
   return std::max(state_.lastRun(), lastRunHere_);
 }
@@ -272,7 +277,7 @@ void ActivityDeliveries::waitForRetry() {
 }
 
 void ActivityDeliveries::wait(std::chrono::nanoseconds duration) {
-  // Nobody signals it, so this only sleeps, by a clock that tests can move.
+  // Nobody signals the semaphore, so this only sleeps, by a clock that tests can move.
   Semaphore never(0);
   clock_.wait(never, duration);
 }

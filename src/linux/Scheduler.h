@@ -1,4 +1,5 @@
-// The background-activity scheduler: when a run is due, when it is deferred, and its delivery.
+// The background-activity scheduler decides when a run is due, defers it at a bad time, and
+// delivers it.
 
 #pragma once
 
@@ -15,12 +16,13 @@
 
 namespace tessel {
 
-// Says whether now is a bad time for a run. It reads files at the moment it is asked. A file that
-// is missing, cannot be read or makes no sense never defers: a service that waits for ever would be
-// worse than one that runs at a bad time. Immutable; any thread may ask.
+// Says whether now is a bad time for a run. It reads files at the moment it is asked. A service
+// that waits for ever would be worse than one that runs at a bad time. So a file that is missing or
+// cannot be understood never defers. Immutable; any thread may ask.
 class DeferralConditions {
  public:
-  // `deferFile` defers by existing. The other two paths are the kernel's; tests have their own.
+  // `deferFile` defers a run while it exists. The other two paths are the kernel's, except in
+  // tests.
   DeferralConditions(DeferSources sources, std::string deferFile,
                      std::string powerSupplyDirectory = "/sys/class/power_supply",
                      std::string pressureFile = "/proc/pressure/cpu");
@@ -39,9 +41,9 @@ class DeferralConditions {
   const std::string pressureFile_;
 };
 
-// How long to wait for the run that comes `interval` after the one that began at `lastRun`. Zero if
-// it is due. `waited` is how long this wait has lasted already, by a clock that nobody can set. It
-// bounds the wait by the interval, whatever happens to the wall clock meanwhile.
+// How long to wait until the next run. It is due `interval` after the begin of the last run; the
+// answer is zero from then on. `waited` is how long this wait has lasted already, by a clock that
+// nobody can set. It keeps the whole wait below the interval even if the wall clock is set back.
 inline std::chrono::nanoseconds waitForRun(std::optional<Date> lastRun, Date now,
                                            std::chrono::seconds interval,
                                            std::chrono::nanoseconds waited) {
@@ -60,9 +62,10 @@ struct ScheduleCriteria {
 
 // Delivers the check-in and then runs to the one activity of the process.
 //
-// Without an interval one run follows the check-in at once. With an interval a run follows whenever
-// that much time has passed since the last one began. An activity takes one state, defer, once,
-// while its run is being delivered. A deferred run is offered again after the retry time.
+// Without an interval one run follows the check-in at once. With an interval a run is delivered
+// whenever that much time has passed since the last run began. While its run is being delivered, an
+// activity may set its state to "defer", once; it takes no other state. A deferred run is delivered
+// again after the retry time.
 //
 // Threads: registerActivity() makes one thread, which calls the handler and lives as long as
 // something is pending. The scheduler and everything given to its constructor live as long as the
@@ -113,7 +116,7 @@ class ActivityDeliveries {
   ServiceStatus& status_;
   Clock& clock_;
   const ActivityHandler handler_;
-  std::optional<Date> lastRunHere_;  // the last run of this process, in case it was not recorded
+  std::optional<Date> lastRunHere_;  // the last run of this process; recording it may have failed
 };
 
 }  // namespace tessel

@@ -1,11 +1,11 @@
 // Process setup, the notification protocol, signals on a thread, the life of the process.
 //
-// A signal is taken by a thread in sigwait() and becomes a closure on a queue. A signal handler was
-// discarded, because next to nothing may be called in one; so was signalfd, which would need an
-// event loop that the service has no other use for.
+// A thread waits for a signal in sigwait() and submits a closure to a queue. A signal handler was
+// discarded, because it may call next to nothing. signalfd was discarded too: it needs an event
+// loop, for which the service has no other use.
 //
-// The process ends in one place, runMainLoop(), by exit(0) while detached threads may still run;
-// see Queues.cpp for why that is safe.
+// runMainLoop() ends the process by exit(0), and so may the closure of a signal. Detached threads
+// may still run then; see Queues.cpp for why that is safe.
 
 #include "linux/ServiceRuntime.h"
 
@@ -27,7 +27,7 @@ namespace tessel {
 namespace {
 
 void fillStandardDescriptors() {
-  // open() answers the lowest free number, so each call fills one gap or lands above them.
+  // open() answers the lowest free number. So each call fills one gap, or there is none left.
   for (;;) {
     // Without O_CLOEXEC: children inherit it like any standard descriptor.
     const int fd = ::open("/dev/null", O_RDWR);
@@ -36,9 +36,9 @@ void fillStandardDescriptors() {
   }
 }
 
-// Blocks from 128 KiB on get a mapping of their own, which goes back to the system when it is
-// freed. A fixed threshold keeps the C library from raising it after the first large block. Two
-// heaps for all threads, and not one for each, so that a thread can use what another one freed.
+// A block of 128 KiB or more gets a mapping of its own, which goes back to the system when it is
+// freed. The C library would raise this threshold after the first large block; setting it keeps it
+// fixed. All threads share two heaps, so that a thread can reuse memory that another thread freed.
 void keepHeapSmall() {
   constexpr int kLargeBlockBytes = 128 << 10;
   constexpr int kHeaps = 2;
@@ -63,7 +63,7 @@ void prepareProcess() {
 }
 
 namespace {
-// The manager advises two signs of life a period. With four a late one does not end the process.
+// The manager advises two signs of life a period. With four, one or two late ones do no harm.
 constexpr int kFeedsPerWatchdogPeriod = 4;
 }  // namespace
 
@@ -91,9 +91,9 @@ void ServiceManager::progress() {
   if (feedInterval_.count() > 0 && takeFeed()) notify_("WATCHDOG=1");
 }
 
-// True for one of the callers once a feed interval has passed since the last true. Without a lock,
-// because the reader of a run calls it for every trace object. Relaxed order is enough: the time
-// alone is shared.
+// True once per feed interval, for one caller only. It has no lock, because a run calls it for
+// every trace object. Relaxed order is enough, because the threads share nothing but this one
+// number.
 bool ServiceManager::takeFeed() {
   const Timebase base = clock_.timebase();
   const uint64_t now = clock_.continuousTicks();
@@ -141,7 +141,7 @@ void ThreadSignalSource::resume() {
   }).detach();
 }
 
-// One unit of one of the runtime's two counters, for as long as it lives.
+// Holds one of the runtime's two counters up by one for as long as it lives.
 class ServiceRuntime::Hold final : public KeepAliveTransaction {
  public:
   Hold(ServiceRuntime& runtime, size_t& counter) : runtime_(runtime), counter_(counter) {
@@ -152,7 +152,8 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
   Hold& operator=(const Hold&) = delete;
   ~Hold() override {
     const std::lock_guard lock(runtime_.mutex_);
-    // Below zero the process would never end, or end in the middle of a run.
+    // A counter that wrapped around would keep the process alive for ever. One that reached zero
+    // too early would end it in the middle of a run.
     TESSEL_INVARIANT(counter_ > 0);
     --counter_;
     runtime_.changed_.notify_all();
@@ -166,7 +167,8 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
 ServiceRuntime::ServiceRuntime(ServiceManager& manager) : manager_(manager) {}
 
 std::unique_ptr<KeepAliveTransaction> ServiceRuntime::openTransaction(const std::string& /*name*/) {
-  // From here on the work itself must send the signs of life. This one gives it a fresh period.
+  // From here on the work itself must send the signs of life. After this call it has at least three
+  // quarters of a watchdog period for the first one.
   manager_.progress();
   return std::make_unique<Hold>(*this, transactions_);
 }

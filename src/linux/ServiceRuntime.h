@@ -18,9 +18,8 @@ namespace tessel {
 //  - blocks SIGINT in this thread and in all later ones, so that an interrupt waits for its signal
 //    source and does not kill the process;
 //  - ignores SIGPIPE, because a log reader that went away is no reason to end;
-//  - opens /dev/null for each standard descriptor that is closed, or a file that is opened later
-//  would
-//    get that number and receive log lines;
+//  - opens /dev/null for each standard descriptor that is closed. Otherwise a file that is opened
+//    later would get that number and receive log lines;
 //  - makes the heap give large blocks back, so that an idle process does not keep the memory of its
 //    last run.
 void prepareProcess();
@@ -28,7 +27,7 @@ void prepareProcess();
 // Blocks `signalNumber` in the calling thread and in those that it starts.
 void blockSignal(int signalNumber);
 
-// Tells the service manager readiness, status in words, and signs of life. If no manager listens,
+// Tells the service manager about readiness, status and signs of life. If no manager listens,
 // every call is cheap and does nothing. Any thread may call. It lives as long as the process.
 class ServiceManager final : public ServiceStatus {
  public:
@@ -43,7 +42,7 @@ class ServiceManager final : public ServiceStatus {
   void ready();
   // The process is about to end.
   void stopping();
-  // Sends the words unless they are those of the last call. Counts as progress.
+  // Sends the words, unless the last call had the same words. Counts as progress.
   void say(std::string_view words) override;
   // Sends a sign of life, at most four times per watchdog period.
   void progress() override;
@@ -97,8 +96,8 @@ class ServiceRuntime final : public Runtime {
   std::shared_ptr<SignalSource> makeSignalSource(int signalNumber,
                                                  std::shared_ptr<SerialQueue> queue) override;
   // Tells the manager that the process is ready, waits until it may end, and ends it. While no
-  // transaction is open, this loop sends the signs of life. While one is open, its work must send
-  // them, or a run that hangs would look alive.
+  // transaction is open, this loop sends the signs of life. While one is open, only its work sends
+  // them: otherwise a run that hangs would look alive.
   [[noreturn]] void runMainLoop() override;
 
   // Keeps the process alive until the result is destroyed, because a delivery is pending. Unlike a

@@ -1,13 +1,13 @@
 // The state directory on disk, and the removal of a marker.
 //
-// The run marker is a file, but anybody who may write to its directory can put a directory there,
-// and a marker that cannot be removed would stop all later runs. So a directory is removed with all
-// that is in it. The service may run as root, so the walk must not be led astray:
-//  - It goes from descriptor to descriptor (openat with O_NOFOLLOW), never by path. A link that
-//    somebody puts in the way between two steps is not followed.
-//  - It enters no other mount. A file system that is mounted below the marker, or bound there from
-//    the root, must not be emptied.
-//  - It has a bounded depth, because each level holds a descriptor.
+// The run marker is a file, but anybody who may write to its directory can put a directory there. A
+// marker that cannot be removed would stop all later runs. So we remove a directory with its whole
+// content. The service may run as root, so nobody may lead this walk to other files:
+//  - It goes from descriptor to descriptor (openat with O_NOFOLLOW), never by path. So it follows
+//  no
+//    link, even one that somebody puts there between two steps.
+//  - It enters no other mount: it must not empty a file system that is mounted below the marker.
+//  - Its depth is bounded, because each level holds a descriptor.
 // std::filesystem::remove_all was discarded: it crosses mounts.
 
 #include "linux/StateDirectory.h"
@@ -36,14 +36,14 @@ namespace {
 constexpr mode_t kDirectoryMode = 0750;
 constexpr size_t kMaxRecordSize = 64;  // a decimal 64-bit number and a line feed take 21
 
-// For a path with a slash at the end, parent_path() would answer the directory itself.
+// parent_path() of "/a/b/" is "/a/b", and we need "/a".
 std::string withoutTrailingSlashes(std::string path) {
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   return path;
 }
 
-// Makes the directory and those above it that are missing. Answers 0 or the errno of the failure.
-// The directory itself is made apart, because only it has this mode.
+// Makes the directory and the missing ones above it. Answers 0 or the errno of the failure. Only
+// the directory itself gets kDirectoryMode, so it has a call of its own.
 int makeDirectory(const std::string& path) {
   const std::filesystem::path parent = std::filesystem::path(path).parent_path();
   std::error_code error;
@@ -81,7 +81,7 @@ std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX
 
 std::optional<Date> StateDirectory::lastRun() const {
   const std::optional<std::string> text = readSmallFile(recordFile(), kMaxRecordSize);
-  // Without its line feed the record is cut short, and its number may be, too.
+  // A record without its line feed was cut short, so its number may be incomplete.
   if (!text || !text->ends_with('\n')) return {};
   int64_t microseconds = 0;
   const char* end = text->data() + text->size() - 1;
@@ -98,8 +98,8 @@ namespace {
 
 constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
-// Tells mounts apart. The device alone would not do: a bind mount of the same file system has the
-// same.
+// Identifies a mount. The device is not enough, because a bind mount of the same file system has
+// the same device.
 using MountKey = std::tuple<uint64_t, uint32_t, uint32_t>;
 
 std::optional<MountKey> mountOf(int directory) {
@@ -121,8 +121,7 @@ class Remover {
 
   // Removes `name` in the directory `parent`. `path` names it in errors.
   bool remove(int parent, const char* name, const std::string& path, int depth) {
-    // Try as a file first: looking before would leave a moment in which it may become another
-    // thing.
+    // Remove it as a file first. If we looked before, it could become something else in between.
     if (::unlinkat(parent, name, 0) == 0) return true;
     const int error = errno;
     if (!isDirectory(parent, name)) return failed(path, errorWords(error));
@@ -172,7 +171,7 @@ FileExistence LocalFiles::existence(const std::string& path) {
   return {true, S_ISDIR(facts.st_mode)};
 }
 
-// Asking first whether anything is there would leave a gap for another process. This is one step.
+// The test and the creation are one step, so no other process can make the file in between.
 bool LocalFiles::createFile(const std::string& path) { return createNewFile(path, 0666); }
 
 RemovalResult LocalFiles::remove(const std::string& path) {

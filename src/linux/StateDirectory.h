@@ -1,5 +1,4 @@
-// Files that outlive the process: the state directory, and the operations that the run marker
-// needs.
+// Files that outlive the process: the state directory, and the file operations for the run marker.
 
 #pragma once
 
@@ -25,12 +24,13 @@ class RunLock {
 
 // The directory for what outlives the process, and the scheduler's files in it.
 //
-//   scheduler-last-run  when the last run began: microseconds since 1970, decimal, and a line feed.
-//                       Only the holder of the lock replaces it, as a whole.
-//   defer               others make and remove it; while it exists, runs are deferred
+//   scheduler-last-run  when the last run began that has ended and was not deferred: microseconds
+//                       since 1970, decimal, and a line feed. Only the holder of the lock writes
+//                       it.
+//   defer               other programs make and remove it; while it exists, runs are deferred
 //
-// A directory that cannot be written still serves. A run then loses its record and its events, and
-// the log says so. Immutable; any thread may use it.
+// The service also runs with a directory that it cannot write. A run then loses its record and its
+// events, and the log says so. Immutable; any thread may use it.
 class StateDirectory {
  public:
   // Makes the directory (mode 0750) if it is missing. The error is one line that names the
@@ -49,8 +49,8 @@ class StateDirectory {
 
   // When the last run began. Absent if there is no record or it cannot be understood.
   std::optional<Date> lastRun() const;
-  // Records a run. Absent if that succeeded; after an error the earlier record still stands.
-  // REQUIRES: the caller holds the lock.
+  // Records a run. The error is absent if that succeeded; replaceFileDurably() says which record
+  // stands after an error. REQUIRES: the caller holds the lock.
   std::optional<PlatformError> recordRun(Date begin) const;
 
  private:
@@ -66,9 +66,9 @@ class LocalFiles final : public FileManager {
  public:
   FileExistence existence(const std::string& path) override;
   bool createFile(const std::string& path) override;
-  // Removes a directory with its content. What is mounted below it stays, and so do the directories
-  // on the way there. So do directories nested deeper than kMaxRemovalDepth. The error names the
-  // first item that could not be removed.
+  // Removes a file, or a directory with its content. Mounted file systems and directories nested
+  // deeper than kMaxRemovalDepth stay, with the directories above them. The error names the first
+  // item that could not be removed.
   RemovalResult remove(const std::string& path) override;
 
   // Each level holds a descriptor, and a process usually has 1024 of them.

@@ -1,7 +1,7 @@
-// Clocks, os-release, mountinfo and ICU.
+// Clocks, os-release, mountinfo, ICU and the metadata of applications.
 //
-// Every source here may be missing or odd in a container. None of these questions fails: each has
-// an answer for "unknown", and the service then decides on the careful side.
+// In a container every one of these sources may be missing or strange. So no question here fails:
+// each has an answer for "unknown".
 
 #include "linux/SystemFacts.h"
 
@@ -28,8 +28,7 @@
 namespace tessel {
 
 uint64_t SystemClock::continuousTicks() {
-  // CLOCK_MONOTONIC would stand still while the machine sleeps, and a run would then come a night
-  // late.
+  // CLOCK_MONOTONIC stands still while the machine sleeps. With it a run could come a night late.
   timespec time{};
   clock_gettime(CLOCK_BOOTTIME, &time);
   return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000 + static_cast<uint64_t>(time.tv_nsec);
@@ -102,7 +101,7 @@ std::string unescaped(std::string_view field) {
 
 // The file system type in one line, if that line is about "/". A line reads
 //   id parent device root MOUNT-POINT options [optional...] - TYPE source options
-// The number of optional fields varies, so the type is looked for behind the dash.
+// The number of optional fields varies, so we skip to the dash.
 std::optional<std::string> typeAtRoot(const std::string& line) {
   std::istringstream fields(line);
   std::string field;
@@ -141,7 +140,7 @@ std::unique_ptr<icu::TimeZone> makeTimeZone(const std::optional<std::string>& na
       icu::TimeZone::createTimeZone(icu::UnicodeString::fromUTF8(*name)));
 }
 
-// A locale whose name ICU cannot read makes it fail later. Such a name counts as "C".
+// If ICU cannot read the name, the locale is bogus and formatting would fail. "C" replaces it.
 icu::Locale makeLocale(const std::string& name) {
   const icu::Locale locale = icu::Locale::createCanonical(name.c_str());
   return locale.isBogus() ? icu::Locale::createCanonical("C") : locale;
@@ -159,7 +158,7 @@ std::string IcuDates::format(Date date) {
       std::chrono::floor<std::chrono::milliseconds>(date).time_since_epoch().count();
   const std::unique_ptr<icu::DateFormat> formatter(icu::DateFormat::createDateTimeInstance(
       icu::DateFormat::kShort, icu::DateFormat::kMedium, makeLocale(locale_)));
-  // ICU without its data cannot make a format. The log then shows the number of seconds.
+  // ICU without its data cannot make a formatter. The seconds since 1970 are better than no date.
   if (!formatter) return std::to_string(milliseconds / 1000);
   if (auto zone = makeTimeZone(timeZone_)) formatter->adoptTimeZone(zone.release());
   icu::UnicodeString text;
@@ -171,9 +170,9 @@ std::string IcuDates::format(Date date) {
 
 // Reading bundle metadata.
 //
-// An identifier decides what may be reported, so a doubtful one is worse than none: two files of a
-// kind may contradict each other, and the order of a directory would then choose. The directories
-// belong to whoever installed the application, so every size is bounded.
+// An identifier decides what may be reported, so a doubtful one is worse than none. Two files of a
+// kind may contradict each other, and the order of the directory must not choose between them. We
+// do not control who wrote these directories, so every size is bounded.
 
 namespace {
 
@@ -197,8 +196,8 @@ bool isLabel(std::string_view label) {
          std::all_of(label.begin(), label.end(), isIdentifierCharacter);
 }
 
-// Two labels or more, as in a D-Bus name. "firefox.desktop" names no bundle: any program may be
-// called that.
+// Two labels or more, as in a D-Bus name. A single word is no identifier, because two vendors may
+// choose the same word.
 bool isReverseDns(std::string_view name) {
   if (name.size() > kMaxIdentifierLength || name.find('.') == std::string_view::npos) return false;
   for (;;) {
@@ -215,8 +214,8 @@ bool hasSuffix(std::string_view name, const std::vector<std::string_view>& suffi
                      [&](std::string_view suffix) { return name.ends_with(suffix); });
 }
 
-// The files in `directory` with one of `suffixes`. At most two, because two are already too many. A
-// directory with too many entries is read in part.
+// The files in `directory` with one of `suffixes`. It stops at the second one, because the caller
+// accepts only a single file. It also stops after kMaxDirectoryEntries, so it may miss files there.
 std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& directory,
                                                    const std::vector<std::string_view>& suffixes) {
   std::vector<std::filesystem::path> found;
@@ -234,7 +233,7 @@ std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& 
   return found;
 }
 
-// The parser accepts several roots and text beside a root, neither of which is well-formed.
+// The parser accepts a document with several root elements, which is not well-formed XML.
 bool hasOneRoot(const pugi::xml_document& document) {
   const auto isElement = [](const pugi::xml_node& node) {
     return node.type() == pugi::node_element;
