@@ -1,8 +1,8 @@
 // One request with libcurl.
 //
 // One handle serves all requests, because it keeps the connection: a TLS handshake costs more than
-// a batch. Redirects are not followed, as a redirected request would take events and credentials to
-// a host that nobody configured.
+// a batch. Redirects are not followed, because a redirect could send events and credentials to a
+// host that nobody configured.
 
 #include "forwarder/Collector.h"
 
@@ -15,8 +15,8 @@ namespace tessel {
 
 namespace {
 
-// An answer is cut off here. Up to here it is read and thrown away, so that the connection can be
-// used again after a long one.
+// A longer answer is cut off, which ends the connection. Up to this length we read and discard what
+// we do not keep, so that the connection can be used again.
 constexpr size_t kMostRead = size_t{16} << 20;
 // The fastest level makes a body of records a tenth as long. Slower ones gain little more.
 constexpr int kCompressionLevel = 1;
@@ -147,7 +147,7 @@ CollectorAnswer CurlCollector::post(std::string_view body) {
   CollectorAnswer answer;
   answer.bytesSent = sent.size();
   answer.body = std::move(reading.body);
-  // The status of an answer that was cut off had arrived, and it is what matters.
+  // If we cut the answer off, its status had already arrived, and only the status matters.
   const bool cutOff = result == CURLE_WRITE_ERROR && reading.received > kMostRead;
   if (result != CURLE_OK && !cutOff) {
     answer.error = with.reason[0] != '\0' ? with.reason : curl_easy_strerror(result);

@@ -1,4 +1,4 @@
-// Where records go: the role Collector, and CurlCollector, which reaches a collector with HTTP.
+// Where records go: the role Collector, and CurlCollector, which sends to a collector over HTTP.
 
 #pragma once
 
@@ -32,9 +32,9 @@ class Collector {
   virtual CollectorAnswer post(std::string_view body) = 0;
 };
 
-// A collector that is reached with HTTP over a connection that stays open. The server's certificate
-// is verified and redirects are not followed. An answer is kept up to kMaxAnswerBytes and read up
-// to a bound far above; one that goes on is cut off, and its status counts.
+// Sends with HTTP over a connection that stays open. It verifies the server's certificate and
+// follows no redirect. It keeps the first kMaxAnswerBytes of an answer and discards what follows.
+// An answer of more than 16 MiB is cut off, and its status still counts.
 //
 // Threads: one at a time, except for cancel(). REQUIRES: curl_global_init() was called.
 class CurlCollector final : public Collector {

@@ -1,4 +1,4 @@
-// The list of output formats, what they know of this machine, and cutting a batch.
+// The list of output formats, the facts of this machine, and the cutting of a batch.
 
 #include "forwarder/Encoder.h"
 
@@ -14,7 +14,7 @@
 
 namespace tessel {
 
-// The output formats. A declaration and an entry for each; the file that defines one is all else.
+// Each format needs this declaration and an entry in kFormats. A header would say no more.
 extern const OutputFormat kOtlpJson;
 
 namespace {
@@ -40,8 +40,8 @@ std::string architectureName() {
 }
 
 std::optional<std::string> instanceId() {
-  // Drawn once for this program. systemd mixes it with the machine id by a keyed hash, so that two
-  // programs of a machine have identifiers that nobody can connect.
+  // A random number that stands for this program. systemd hashes it together with the machine id.
+  // So two programs on one machine have identifiers that nobody can connect.
   constexpr sd_id128_t kApplication{{0x6b, 0x1d, 0x0a, 0x5c, 0x9e, 0x3f, 0x4f, 0x0c, 0x8b, 0x61,
                                      0xd2, 0x77, 0x3a, 0x90, 0xe4, 0x15}};
   sd_id128_t id{};
@@ -70,7 +70,7 @@ Batch cutBatch(std::vector<SpooledEvent> events, const Encoder& encoder, std::st
   for (SpooledEvent& event : events) {
     auto text = encoder.record(event, spoolId);
     if (text) {
-      // One more byte for what separates it from its neighbour.
+      // One byte more, for the comma between two records.
       bytes += text->size() + 1;
       if (bytes > maxBytes && !batch.records.empty()) break;
     }

@@ -1,8 +1,8 @@
-// The forwarder's output formats: the role Encoder, the list of those that exist, and the batches
-// that they encode.
+// The forwarder's output formats: the role Encoder, the list of formats, and the batches that an
+// encoder turns into requests.
 //
-// A new format is a file that defines an OutputFormat, and its line in the list in Encoder.cpp.
-// Nothing else knows which format is sent. Encoders are immutable; any thread may use them.
+// To add a format, write a file that defines an OutputFormat and add it to the list in Encoder.cpp.
+// No other code knows the formats. Encoders are immutable; any thread may use them.
 
 #pragma once
 
@@ -17,7 +17,8 @@
 
 namespace tessel {
 
-// What all records of this machine have in common. Neither its host name nor its machine id.
+// The facts that all records of this machine share. The host name and the machine id are left out
+// on purpose.
 struct ResourceFacts {
   std::string serviceVersion;
   std::string osName;
@@ -26,9 +27,8 @@ struct ResourceFacts {
   std::optional<std::string> instanceId;  // absent unless the operator asked for one
 };
 
-// The facts of this machine, from its os-release file and its kernel. With `withInstanceId` they
-// hold an identifier of this machine that is made for this program: nobody can compute the machine
-// id from it.
+// The facts of this machine, from its os-release file and its kernel. `withInstanceId` adds an
+// identifier of the machine that only this program uses. Nobody can compute the machine id from it.
 ResourceFacts readResourceFacts(const std::string& osReleasePath, bool withInstanceId);
 
 // A row of the spool and the record that it becomes.
@@ -37,7 +37,7 @@ struct OutgoingRecord {
   std::string text;
 };
 
-// What the answer to a request that was accepted says about its records.
+// What the answer to an accepted request says about its records.
 struct PartialSuccess {
   uint64_t rejected = 0;  // records that the collector took and threw away
   std::string message;    // its reason, as it stands in the answer
@@ -48,19 +48,19 @@ class Encoder {
   virtual ~Encoder() = default;
   // The media type of a body.
   virtual std::string_view contentType() const = 0;
-  // One record. The same row always yields the same bytes, because a collector may see it twice and
-  // tells it by them. Absent if the payload is not a flat JSON object.
+  // One record. The same row always gives the same bytes: a collector may receive it twice and must
+  // be able to recognise it. Absent if the payload is not a flat JSON object.
   virtual std::optional<std::string> record(const SpooledEvent& event,
                                             std::string_view spoolId) const = 0;
   // The body of the request that carries `records`.
   virtual std::string body(std::span<const OutgoingRecord> records) const = 0;
-  // Reads the body of an answer. One that cannot be understood rejects nothing.
+  // Reads the body of an answer. A body that cannot be understood counts as no rejection.
   virtual PartialSuccess partialSuccess(std::string_view answer) const = 0;
 };
 
 struct OutputFormat {
   std::string_view protocol;  // its name in OTEL_EXPORTER_OTLP_PROTOCOL
-  std::string_view path;      // where a collector takes it, below the collector's address
+  std::string_view path;      // of its endpoint, below the collector's address
   std::unique_ptr<Encoder> (*makeEncoder)(const ResourceFacts& facts);
 };
 
@@ -74,9 +74,9 @@ struct Batch {
   int64_t lastId = 0;                   // the highest id in both lists
 };
 
-// Takes events from the front until their records hold `maxBytes`; the rest is left for the next
-// batch. One record is taken however long it is, or it would never leave. REQUIRES: `events` is not
-// empty.
+// Takes events from the front until their records hold `maxBytes`, and leaves the others for the
+// next batch. The first record is taken however long it is, because it would never leave otherwise.
+// REQUIRES: `events` is not empty.
 Batch cutBatch(std::vector<SpooledEvent> events, const Encoder& encoder, std::string_view spoolId,
                size_t maxBytes);
 

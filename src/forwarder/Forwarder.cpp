@@ -1,12 +1,12 @@
 // Delivering batch after batch.
 //
 // A collector refuses a batch as a whole and does not say which record is at fault. Halving finds
-// it: one bad record among 512 costs about 20 requests, and the good ones still arrive in order. To
-// send each record alone after a refusal was discarded, as it costs 512.
+// it: one bad record among 512 costs about 20 requests, and the good ones still arrive in order.
+// Sending each record alone after a refusal was discarded, because it costs 512 requests.
 //
-// The danger is a collector that refuses everything by its own fault. Halving would then set the
-// whole spool aside. Hence the limit on refusals in a row: at most that many records move, and then
-// all wait.
+// A collector that is itself at fault may refuse everything. Halving would then set the whole spool
+// aside. So the number of refusals in a row is limited: deliverAll() sets at most that many records
+// aside and then ends. The next call begins to count anew.
 
 #include "forwarder/Forwarder.h"
 
@@ -21,15 +21,15 @@ namespace tessel {
 
 // Verdicts, waits and pace.
 //
-// The verdicts follow OTLP's list of statuses that a client may repeat, with one addition: 401,
-// 403, 404, 405, 407 and redirects speak of the way to the collector and not of the records. To
-// take them for refusals would set good records aside after a wrong password.
+// OTLP lists the statuses after which a client may send again. We add one rule: 401, 403, 404, 405,
+// 407 and redirects are about the way to the collector and not about the records. If they counted
+// as refusals, a wrong password would set good records aside.
 
 namespace {
 
 // A collector may ask for a longer wait by mistake. After an hour it is asked again.
 constexpr std::chrono::seconds kLongestAsked{3600};
-// Of a collector's words: enough for a sentence, and short in a log line.
+// Bytes of a collector's answer that we quote: enough for a sentence, short enough for a log line.
 constexpr size_t kMaxWords = 300;
 
 }  // namespace
@@ -65,7 +65,7 @@ std::string answerWords(const CollectorAnswer& answer) {
 
 std::chrono::milliseconds Backoff::wait(uint32_t failures, double chance,
                                         std::optional<std::chrono::seconds> asked) const {
-  // 30 doublings of any wait are over the longest one, and 2^30 is still exact.
+  // 30 doublings bring any wait above the longest one. More could overflow to infinity.
   const double doublings = std::min(failures - 1, uint32_t{30});
   const double full = std::min(static_cast<double>(first_.count()) * std::exp2(doublings),
                                static_cast<double>(most_.count()));
@@ -82,15 +82,15 @@ std::chrono::nanoseconds Pace::waitAt(std::chrono::nanoseconds now) const {
 
 void Pace::sent(uint64_t records, std::chrono::nanoseconds now) {
   if (recordsPerSecond_ == 0) return;
-  // A request is paid for after it was sent, so the first one of a day goes out at once.
+  // The wait comes after the request that causes it, so the first one of a day goes out at once.
   next_ = now + std::chrono::nanoseconds{std::chrono::seconds{1}} * records / recordsPerSecond_;
 }
 
 namespace {
 
-// Free space is given back in small steps, because each holds the lock for which a send of the
-// service may wait. The breaks let such a send through. The number of steps is bounded, because new
-// events wait for the end of the last one.
+// Free space is given back in small steps, because a send of the service may wait for the lock that
+// each step holds. The breaks let such a send through. The number of steps is bounded, because no
+// new event is delivered before the last step.
 constexpr int kPagesGivenBackAtOnce = 64;
 constexpr int kStepsAtOnce = 50;
 constexpr std::chrono::milliseconds kBetweenSteps{20};
@@ -122,7 +122,7 @@ ForwarderOutcome Forwarder::deliverAll() {
     }
     sayProgress();
   }
-  // Everything is delivered, so the collector waits for nothing while the file gets shorter.
+  // Everything is delivered, so shortening the file delays no event that waits now.
   for (int step = 0; step < kStepsAtOnce; ++step) {
     if (!world_.state.shrink(kPagesGivenBackAtOnce) || !takeBreak(kBetweenSteps)) break;
   }
@@ -131,7 +131,7 @@ ForwarderOutcome Forwarder::deliverAll() {
 
 ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
   const uint64_t settledBefore = settled();
-  // Rows that cannot become records go first: they must not wait for a collector.
+  // Rows that cannot become records need no collector, so they must not wait for one.
   for (const SpooledEvent& event : batch.malformed) {
     if (!setAside(event, 0, "the payload is not a flat JSON object")) return outcome_;
   }
@@ -152,7 +152,7 @@ ForwarderOutcome Forwarder::deliverBatch(const Batch& batch) {
         break;
     }
   }
-  // However the batch was split, each of its rows was delivered or set aside, and none twice.
+  // However the batch was split: each of its rows was delivered or set aside, and none twice.
   TESSEL_INVARIANT(settled() - settledBefore == batch.records.size() + batch.malformed.size());
   return ForwarderOutcome::delivered;
 }
@@ -184,7 +184,7 @@ Forwarder::Sent Forwarder::send(Records part) {
 
 bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
   const std::string words = answerWords(answer);
-  // Said once per batch in the log; the status shows the present state.
+  // The log tells this once per batch. The status shows the latest answer.
   if (failures == 1) kForwarderLog.error("The collector takes nothing for now: %@", words);
   world_.status.say("Waiting for the collector: " + words);
   ++world_.state.counters().retries;
@@ -200,7 +200,7 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
     return fail(ForwarderOutcome::held, "record after record is refused: " + answerWords(answer));
   }
   refusals_ = 0;
-  // A partial success is final: the collector has taken the batch and would take the others twice.
+  // After a partial success nothing is sent again: the collector would take the good records twice.
   const PartialSuccess partial = world_.encoder.partialSuccess(answer.body);
   if (partial.rejected > 0) {
     world_.state.counters().rejected += partial.rejected;
@@ -226,7 +226,7 @@ bool Forwarder::setAside(const SpooledEvent& event, int64_t status, const std::s
 // Waits. False if somebody asked to stop.
 bool Forwarder::takeBreak(std::chrono::nanoseconds time) {
   if (!world_.clock.wait(world_.stop, time)) return true;
-  // The wait has taken the signal, and the next one must see it as well.
+  // This wait has used the signal up. Signal again, because later waits must see it too.
   world_.stop.signal();
   return false;
 }

@@ -3,11 +3,9 @@
 //  - A batch that the collector takes is acknowledged in the spool.
 //  - A batch that it cannot take now is sent again after a while, for ever or a few times.
 //  - A batch that it refuses is split until the record at fault stands alone. That record is set
-//  aside
-//    with the collector's words, and the others go on.
-//  - An answer about the address or the credentials holds everything up and sets nothing aside. So
-//  do
-//    many refused records in a row with none taken between them.
+//    aside with the collector's words, and the others are delivered.
+//  - An answer about the address or the credentials stops the delivery and sets nothing aside.
+//  - Many refused records in a row, with none taken between them, stop the delivery too.
 //
 // Threads: one at a time. Signalling the stop semaphore ends every wait early.
 
@@ -30,8 +28,8 @@
 
 namespace tessel {
 
-// What an answer means, when to try again, and how fast to send. Plain arithmetic without clock or
-// thread.
+// What an answer means, when to try again, and how fast to send. All of it is plain arithmetic,
+// without a clock or a thread.
 
 enum class Verdict {
   accepted,  // any 2xx
@@ -53,10 +51,11 @@ class Backoff {
   Backoff(std::chrono::milliseconds first, std::chrono::milliseconds most)
       : first_(first), most_(most) {}
 
-  // The wait after the `failures`-th failure in a row, counted from 1. `chance` is drawn from [0,
-  // 1) for each wait. Half of the wait is certain and half is chance, so that a fleet that failed
-  // together does not come back together. If the collector asked for a wait, that one counts, up to
-  // an hour, and chance is added to it, because it asked the whole fleet for the same.
+  // The wait after a failure. `failures` counts the failures in a row, this one included. `chance`
+  // is a new random number below 1 for each wait. Half of the wait is fixed and half is random, so
+  // that a fleet that failed together does not come back together. If the collector asked for a
+  // wait, we wait that long, up to an hour, and a random time more: it asked the whole fleet for
+  // the same wait.
   std::chrono::milliseconds wait(uint32_t failures, double chance,
                                  std::optional<std::chrono::seconds> asked) const;
 
@@ -73,7 +72,7 @@ class Pace {
 
   // How long to wait at `now` before the next request.
   std::chrono::nanoseconds waitAt(std::chrono::nanoseconds now) const;
-  // Takes note of a request with `records` that is sent at `now`.
+  // Takes note of a request with that many records, sent at `now`.
   void sent(uint64_t records, std::chrono::nanoseconds now);
 
  private:
@@ -90,7 +89,7 @@ struct ForwarderOptions {
   uint32_t maxAttempts = 0;           // to send one batch; 0: no limit
   std::chrono::milliseconds firstRetry{5000};
   std::chrono::milliseconds longestRetry{300'000};
-  uint32_t refusalsInARow = 16;     // after so many the fault is taken to be the collector's
+  uint32_t refusalsInARow = 16;     // so many mean that the collector itself is at fault
   uint64_t recordsPerSecond = 100;  // 0: no limit
 };
 
@@ -128,7 +127,7 @@ class Forwarder {
   enum class Sent { accepted, refused, failed };
 
   ForwarderOutcome deliverBatch(const Batch& batch);
-  // If it answers `failed`, `outcome_` and `reason_` say how.
+  // After `failed`, `outcome_` and `reason_` say what has failed.
   Sent send(Records part);
   bool waitToRetry(const CollectorAnswer& answer, uint32_t failures);
   Sent settle(Records part, const CollectorAnswer& answer);

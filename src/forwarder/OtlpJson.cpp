@@ -2,10 +2,9 @@
 //
 // A record has the event's name as `eventName`, its time, and the payload's members as flat
 // attributes in payload order. An attribute has the kind of its member: string, boolean, integer (a
-// decimal string) or double (the very digits of the spool). OTLP has no kind for an unsigned
-// integer above 2^63-1, so that one becomes a string. The attribute `log.record.uid` joins the
-// spool's identifier and the row's id, so that a backend can tell a record that arrives twice from
-// a new one.
+// decimal string) or double (with the digits of the spool). OTLP has no kind for an integer above
+// 2^63-1, so such an integer becomes a string. The attribute `log.record.uid` joins the spool's
+// identifier and the row's id. By it a backend recognises a record that arrives twice.
 //
 // A record goes from the parser's events straight to the writer. A document tree between them was
 // discarded: it costs several allocations per attribute and prints numbers anew, so that the
@@ -28,8 +27,8 @@ namespace {
 
 using Json = nlohmann::json;
 
-// These members are floating-point numbers, even if their digits look like an integer's: the spool
-// writes 2.0 as 2. A backend that met both kinds under one name would refuse one of them.
+// These members are floating-point numbers, but the spool writes 2.0 as 2, which looks like an
+// integer. A backend that receives both kinds under one name may refuse one of them.
 constexpr std::string_view kFloatingKeys[] = {"DurationInSeconds", "FrameRate",
                                               "ProcessingDurationInSeconds"};
 
@@ -50,8 +49,8 @@ void writeText(JsonWriter& json, std::string_view key, std::string_view text) {
   writeAttribute(json, key, [&] { json.member("stringValue", text); });
 }
 
-// Writes one attribute for each member of a flat object and stops at anything else. It works on the
-// parser's events, because only they carry the digits of a number.
+// Writes one attribute for each member of a flat object, and stops the parser at anything else. It
+// works on the parser's events, because only they have the digits of a number.
 class AttributeWriter final : public nlohmann::json_sax<Json> {
  public:
   explicit AttributeWriter(JsonWriter& json) : json_(json) {}
@@ -146,8 +145,8 @@ OtlpEncoder::OtlpEncoder(const ResourceFacts& facts) {
 
 std::optional<std::string> OtlpEncoder::record(const SpooledEvent& event,
                                                std::string_view spoolId) const {
-  // The spool has microseconds. The event has no other time, so both of the record's times are this
-  // one.
+  // The spool has microseconds and OTLP wants nanoseconds. An event has only this one time, so both
+  // times of the record are equal.
   const std::string time = std::to_string(event.time) + "000";
   std::string out;
   JsonWriter json(out);
@@ -184,8 +183,8 @@ std::string OtlpEncoder::body(std::span<const OutgoingRecord> records) const {
   return all;
 }
 
-// A collector may answer with any body, a page of HTML included. Whatever is not understood counts
-// as no rejection: the status has already said that the batch was taken.
+// A collector may answer with any body, even an HTML page. A body that we do not understand counts
+// as no rejection, because the status has already said that the batch was taken.
 PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {
   const auto json = nlohmann::json::parse(answer, nullptr, false);
   if (!json.is_object()) return {};

@@ -1,6 +1,6 @@
 // Reading the forwarder's variables.
 //
-// OpenTelemetry's names are used where it has one, because whoever runs a collector knows them.
+// Where OpenTelemetry has a variable we use its name, because people who run a collector know it.
 // Secrets may come as files, because every process of the user can read an environment.
 
 #include "forwarder/Settings.h"
@@ -23,7 +23,7 @@ namespace tessel {
 
 namespace {
 
-constexpr size_t kMaxCredentialBytes = size_t{64} << 10;  // more headers no server would take
+constexpr size_t kMaxCredentialBytes = size_t{64} << 10;  // servers refuse headers of that size
 
 using Headers = std::vector<std::string>;
 
@@ -37,13 +37,13 @@ class Variables {
  public:
   explicit Variables(const EnvironmentReader& environment) : environment_(environment) {}
 
-  // OpenTelemetry has it that an empty variable counts as one that is not set.
+  // By OpenTelemetry's rules an empty variable counts as unset.
   std::optional<std::string> value(const std::string& name) const {
     std::optional<std::string> text = environment_(name);
     if (text && text->empty()) text.reset();
     return text;
   }
-  // OTEL_EXPORTER_OTLP_LOGS_<name>, or OTEL_EXPORTER_OTLP_<name> without it. The answer holds the
+  // OTEL_EXPORTER_OTLP_LOGS_<name>, or else OTEL_EXPORTER_OTLP_<name>. The answer holds the
   // full name, so that an error names the variable that the operator has set.
   std::optional<Variable> standard(const std::string& name) const {
     for (const char* prefix : {"OTEL_EXPORTER_OTLP_LOGS_", "OTEL_EXPORTER_OTLP_"}) {
@@ -58,8 +58,8 @@ class Variables {
   void complain(const std::string& name, const std::string& text, const std::string& expected) {
     if (!error_) error_ = LaunchError{name, text, expected};
   }
-  // A whole number from `least` to a year in seconds. A larger one is a typing mistake, and sums of
-  // such times are far from overflow.
+  // A whole number from `least` to 31,536,000, which is a year in seconds. A larger one is surely a
+  // typing mistake, and sums of such times cannot overflow.
   std::optional<int64_t> number(const std::string& name, int64_t least) {
     const auto text = value(name);
     if (!text) return {};
@@ -133,16 +133,16 @@ std::string urlPart(CURLU* url, CURLUPart part) {
   return text;
 }
 
-// Only what cannot mean another machine counts. Other names are not resolved, because their address
-// may change before the request.
+// Accepts only names and addresses that can never mean another machine. Other names are not
+// resolved, because their address may change before the request.
 bool isLoopback(const std::string& host) {
   if (host == "localhost" || host == "[::1]") return true;
   in_addr address{};
   return inet_pton(AF_INET, host.c_str(), &address) == 1 && (ntohl(address.s_addr) >> 24) == 127;
 }
 
-// Whether events may be sent to the URL `text`. Plain http shows them and the credentials to the
-// network, so it needs the operator's word unless it stays on this machine.
+// Whether events may be sent to the URL `text`. Plain http shows events and credentials to the
+// network. So it needs the operator's consent, unless the request stays on this machine.
 bool acceptable(const std::string& text, bool allowHttp) {
   const CurlUrl url(curl_url(), &curl_url_cleanup);
   if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return false;
@@ -170,8 +170,8 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
     variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
     return;
   }
-  // As OpenTelemetry has it: a path is appended to the address of the collector for all signals,
-  // and the address for logs is taken as it stands.
+  // OpenTelemetry's rule: the address for all signals gets the path of this signal appended, and
+  // the address for logs is complete as it is.
   settings.url = endpoint->value;
   if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
     while (settings.url.ends_with('/')) settings.url.pop_back();
@@ -193,8 +193,8 @@ void addHeaders(Variables& variables, ForwarderSettings& settings, const std::st
   settings.headers.insert(settings.headers.end(), headers->begin(), headers->end());
 }
 
-// $CREDENTIALS_DIRECTORY is the service manager's: files that only this service can read, gone when
-// it ends.
+// The service manager makes $CREDENTIALS_DIRECTORY. Only this service can read its files, and they
+// are gone when the service ends.
 void readCredentials(Variables& variables, ForwarderSettings& settings) {
   const auto directory = variables.value("CREDENTIALS_DIRECTORY");
   if (!directory) return;

@@ -1,4 +1,5 @@
-// ForwarderSettings: what the environment says about the forwarder. It is read once, at the start.
+// ForwarderSettings: the settings that the environment gives the forwarder. Read once, at the
+// start.
 //
 // The collector is set by OpenTelemetry's variables OTEL_EXPORTER_OTLP_<NAME>, where <NAME> is
 // ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE, CLIENT_CERTIFICATE, CLIENT_KEY or PROTOCOL
@@ -42,8 +43,8 @@ struct ForwarderSettings {
   bool sendInstanceId = false;
 };
 
-// The error is the first variable that makes no sense. A missing endpoint is an error, too. It
-// never quotes headers, which hold secrets.
+// The error is the first variable with an invalid value. A missing endpoint is an error, too. An
+// error never quotes headers, because they hold secrets.
 std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     const EnvironmentReader& environment);
 // The output format alone, which needs no endpoint.

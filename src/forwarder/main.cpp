@@ -1,8 +1,8 @@
 // The program statora_forwarder: reads the spool and sends it to a collector.
 //
 // It is a program of its own, under a user of its own, so that the service needs no network and the
-// network reaches nothing but the spool. A signal ends it between two transactions or in the middle
-// of a request; either way the rows of that request stay and go out again at the next start.
+// network reaches nothing but the spool. A signal may end it in the middle of a request. The rows
+// of that request then stay in the spool and are sent again at the next start.
 
 #include <curl/curl.h>
 #include <signal.h>
@@ -30,14 +30,14 @@ struct Arguments {
   bool requeue = false;
 };
 
-// Not reproducible on purpose: machines of a fleet that drew the same numbers would come together.
+// The seed is random on purpose: a fleet that drew the same numbers would send at the same time.
 double chance() {
   static std::mt19937_64 random{std::random_device{}()};
   return std::uniform_real_distribution<double>(0, 1)(random);
 }
 
-// Prints the bodies of everything that waits, one a line: those that would be sent if no request
-// failed. It reads without leave to write, so that it can run beside the service and the forwarder.
+// Prints the bodies that would be sent if no request failed, one a line. It opens the spool only
+// for reading, so that it can run beside the service and the forwarder.
 int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   const ForwarderOptions options;
   ForwarderState state(launch.stateDirectory);
@@ -54,7 +54,7 @@ int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   }
 }
 
-// Works beside a running forwarder: the rows move in one transaction.
+// It can run beside a forwarder, because the rows move in one transaction.
 int requeue(const std::string& stateDirectory) {
   ForwarderState state(stateDirectory);
   SqliteStatus status = state.open();
@@ -67,8 +67,8 @@ int requeue(const std::string& stateDirectory) {
   return 0;
 }
 
-// At SIGTERM and SIGINT, ends every wait and the present request. A collector that hangs would
-// otherwise keep the process for the whole timeout.
+// Makes SIGTERM and SIGINT end every wait and the present request. Otherwise a collector that hangs
+// would keep the process until the timeout.
 void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
   const auto queue = std::make_shared<WorkerQueue>("statora_forwarder signal queue");
   for (const int signalNumber : {SIGTERM, SIGINT}) {
@@ -81,8 +81,8 @@ void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
   }
 }
 
-// From sysexits.h, so that a timer or a script can tell "try again" (75) from "put something
-// right".
+// The statuses of sysexits.h. By them a timer or a script can tell "try again" (75) from a fault
+// that an operator must repair.
 int exitStatus(ForwarderOutcome outcome) {
   switch (outcome) {
     case ForwarderOutcome::delivered:
@@ -146,7 +146,7 @@ class Service {
   int runForEver() {
     manager_->ready();
     manager_->say("Waiting for its turn in the fleet");
-    // A fleet that starts at the same minute must not come to the collector in the same second.
+    // A fleet that starts in the same minute must not reach the collector in the same second.
     const std::chrono::duration<double> turn = settings_.spread * chance();
     bool stopped = clock_.wait(stop_, std::chrono::duration_cast<std::chrono::nanoseconds>(turn));
     while (!stopped) {
@@ -160,9 +160,10 @@ class Service {
   }
 
  private:
-  // With --once somebody else starts the next attempt. Eight wait five to ten minutes in all.
+  // With --once, something else starts the next attempt. By default eight attempts take five to ten
+  // minutes with their waits.
   static constexpr uint32_t kAttemptsAtOnce = 8;
-  // An operator has to put an address or a password right, which takes longer than a retry.
+  // An operator has to correct an address or a password, which takes longer than a retry.
   static constexpr std::chrono::seconds kHold{300};
 
   static ForwarderOptions optionsFor(const ForwarderSettings& settings) {
@@ -223,7 +224,8 @@ int run(const Arguments& arguments) {
   static LogSink* const sink =
       makeLogSink(configuration.logDestination, "statora_forwarder").release();
   setLogSink(sink, configuration.logLevel);
-  // Neither of these two needs a collector, so the settings that name one are not read for them.
+  // Neither --requeue nor --dry-run needs a collector, so the settings of one are not read for
+  // them.
   if (arguments.requeue) return requeue(configuration.stateDirectory);
   if (arguments.dryRun) {
     const auto output = readOutputFormat(environment);
