@@ -14,16 +14,18 @@ namespace tessel {
 
 namespace {
 
-// Read at once. The shown beginning of a value, some 4 KiB, rarely needs more compressed bytes.
+// Compressed bytes that are read at once. The tokenizer sees only the first 4 KiB of a value, and
+// one read is nearly always enough for these.
 constexpr size_t kInputSize = size_t{16} << 10;
-// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD). A payload that asks
-// for much more was not written by it and would only make us allocate. 2^22 bytes are 4 MiB.
+// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD). The daemon did not
+// write a payload that asks for much more, and such a payload would only make us allocate. The log
+// of 22 stands for 4 MiB.
 constexpr uint64_t kXzMemoryLimit = uint64_t{8} << 20;
 constexpr int kZstdLargestWindowLog = 22;
 
 }  // namespace
 
-// Making a context costs more than decompressing a value, so it is kept. XZ has nothing to keep.
+// Making a context costs more than decompressing a value, so we keep it.
 struct Decompressor::ZstdContext {
   ZSTD_DCtx* context = ZSTD_createDCtx();
   ZstdContext() { ZSTD_DCtx_setParameter(context, ZSTD_d_windowLogMax, kZstdLargestWindowLog); }
@@ -72,8 +74,9 @@ std::optional<Decompressor::Result> Decompressor::decompressXz(const Source& sou
   return Result{target.size(), false};
 }
 
-// The payload is the size of the text, eight bytes, and one block. Text that compresses badly makes
-// a block hardly longer than the text, so input_ holds what the shown beginning needs.
+// The payload begins with the size of the text in eight bytes; one block follows. A block is hardly
+// longer than its text, even if the text compresses badly. So input_ has room for all that the
+// first 4 KiB need, and one read is enough.
 std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& source,
                                                                 std::span<uint8_t> target) {
   constexpr size_t kSizeBytes = 8;
@@ -85,15 +88,18 @@ std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& so
       reinterpret_cast<const char*>(input_.data()) + kSizeBytes,
       reinterpret_cast<char*>(target.data()), static_cast<int>(got - kSizeBytes), wanted,
       static_cast<int>(target.size()));
-  // A block that holds less than it states leaves bytes of another value in `target`.
+  // If the block holds less than the payload states, the rest of `target` still has bytes of
+  // another value.
   if (produced < wanted) return std::nullopt;
   return Result{static_cast<size_t>(wanted), size <= target.size()};
 }
 
 std::optional<Decompressor::Result> Decompressor::decompressZstd(const Source& source,
                                                                  std::span<uint8_t> target) {
-  // Most stores are not compressed with ZSTD, or have no long value, so the context waits for one.
+  // Many stores never need the context: other compression, or no long value. So the first use makes
+  // it.
   if (!zstd_) zstd_ = std::make_unique<ZstdContext>();
+  // The last value was seldom read to its end, so the context still stands in the middle of it.
   ZSTD_DCtx_reset(zstd_->context, ZSTD_reset_session_only);
   ZSTD_outBuffer output{target.data(), target.size(), 0};
   ZSTD_inBuffer input{input_.data(), 0, 0};
@@ -107,6 +113,7 @@ std::optional<Decompressor::Result> Decompressor::decompressZstd(const Source& s
     }
     const size_t left = ZSTD_decompressStream(zstd_->context, &output, &input);
     if (ZSTD_isError(left) != 0) return std::nullopt;
+    // 0 says that the frame is complete; a payload is one frame.
     if (left == 0) return Result{output.pos, true};
   }
   return Result{output.pos, false};

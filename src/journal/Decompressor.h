@@ -1,7 +1,7 @@
 // Decompressor: the beginning of a payload that was compressed with XZ, LZ4 or ZSTD.
 //
 // It never produces more than the caller asks for, so a small payload that claims to be gigabytes
-// costs nothing. What a payload may make the libraries allocate is bounded too.
+// costs nothing. It also bounds the memory that the libraries allocate for a payload.
 //
 // Threads: one at a time.
 
@@ -31,8 +31,8 @@ class Decompressor {
   Decompressor(const Decompressor&) = delete;
   Decompressor& operator=(const Decompressor&) = delete;
 
-  // Fills `target` with the beginning of the payload. `compression` is one
-  // journal_format::DataFlag. Nothing if the payload is damaged or needs too much memory.
+  // Fills `target` with the beginning of the decompressed payload. `compression` is one
+  // journal_format::DataFlag. Returns nothing if the payload is damaged or needs too much memory.
   std::optional<Result> decompress(uint8_t compression, const Source& source,
                                    std::span<uint8_t> target);
 

@@ -12,8 +12,8 @@ namespace tessel {
 using namespace journal_format;
 
 namespace {
-// Bytes. The windows of thousands of files are small, and the pieces of their chains with them; yet
-// a piece of 32 entries keeps system calls rare.
+// Bytes. If a store has thousands of files, their windows are small and so are the pieces of their
+// chains. A piece of 32 entries still keeps system calls rare.
 constexpr size_t kSmallestPiece = 256;
 }  // namespace
 
@@ -25,7 +25,8 @@ EntryChain::EntryChain(JournalFile& file, uint64_t first, uint64_t count, size_t
   if (!enterArray(first) && count_ != 0) damagedAt(first);
 }
 
-// Kept out of next(), which is called for every entry and must stay small enough to be inlined.
+// next() is called for every entry and must stay small enough to be inlined. So the rare part is
+// here.
 uint64_t EntryChain::firstOfNextPiece() {
   bool more = true;
   while (more && pieceNext_ == pieceSize_) more = loadPiece();
@@ -33,8 +34,8 @@ uint64_t EntryChain::firstOfNextPiece() {
   return more ? last_ = itemAt(pieceNext_++) : 0;
 }
 
-// Makes the array at `offset` the one that is read. The daemon appends arrays, so a link only leads
-// forward in an intact file; demanding that also ends a circle of links.
+// Begins to read the array at `offset`. The daemon only appends arrays, so in an intact file each
+// link leads forward. We refuse a link that leads back, and so no circle of links can hold us.
 bool EntryChain::enterArray(uint64_t offset) {
   const uint64_t previous = std::exchange(array_, 0);
   if (offset <= previous || !file_.mayHoldObject(offset, kArrayItemsAt)) return false;
@@ -84,8 +85,9 @@ bool EntryChain::loadPiece() {
   return true;
 }
 
-// Reads `count` items. False if they are not usable, and then the piece is empty. One bad offset
-// condemns the whole piece: damage is rarely one word, and the search finds all its entries anyway.
+// Reads `count` items as the next piece. If one of them is wrong, returns false and leaves the
+// piece empty. One wrong offset is enough, because damage is rarely a single word, and the search
+// finds all entries of the piece anyway.
 bool EntryChain::takePiece(size_t count) {
   pieceSize_ = pieceNext_ = 0;
   const uint64_t from = array_ + kArrayItemsAt + arrayIndex_ * itemSize_;
@@ -95,7 +97,8 @@ bool EntryChain::takePiece(size_t count) {
   for (size_t i = 0; i < count; ++i) {
     const uint64_t offset = itemAt(i);
     if (offset <= previous || !file_.mayHoldObject(offset, kEntryItemsAt)) {
-      // The array is longer than its entries: zeros follow, or entries that were linked meanwhile.
+      // All entries that the header counts came before this item. An array is allocated longer than
+      // it is filled, so zeros follow, or entries that were linked after we read the header.
       if (listed_ + i < count_) return false;
       pieceSize_ = i;
       array_ = 0;
@@ -109,9 +112,9 @@ bool EntryChain::takePiece(size_t count) {
 
 namespace {
 
-// Reading the index costs one read for each field and each value. A file with more of them was made
-// to cost time; it is read without its index. A real one has some hundred fields, and a marked
-// field has three values, one list each.
+// Reading the index costs one read for each field and each value. A real file has some hundred
+// fields, and its marked fields have a few values with one list each. A file that exceeds these
+// bounds was made to cost time, so we read it without its index.
 constexpr uint64_t kMaxFields = 4096;
 constexpr uint64_t kMaxFieldTable = uint64_t{1} << 20;  // bytes; real tables have 5 KiB
 constexpr size_t kMaxValues = 1024;
@@ -124,9 +127,9 @@ std::string_view textAt(const uint8_t* at, size_t size) {
 
 }  // namespace
 
-// Walks from the table of fields to the values of the marked ones and to their lists. Every step
-// returns false if the index does not hold. No read moves the window: it stays at the
-// first entry.
+// Walks from the table of fields to the values of the marked fields, and from there to their lists.
+// Every step returns false if it finds the index damaged or too large. No read uses the window: the
+// objects lie far apart, and each would load a whole window.
 class MarkedEntries::IndexReader {
  public:
   IndexReader(JournalFile& file, const StopFlag& stop) : file_(file), stop_(stop) {}
@@ -164,7 +167,8 @@ class MarkedEntries::IndexReader {
   std::vector<List> lists_;
 };
 
-// Reads the beginning of an object of type `type` into `target`; at least `least` bytes, if true.
+// Reads the beginning of the object at `offset` into `target`. True if the object has the type
+// `type` and at least `least` bytes were read.
 bool MarkedEntries::IndexReader::readObject(uint64_t offset, ObjectType type, size_t least,
                                             std::span<uint8_t> target) {
   if (stopped() || !file_.mayHoldObject(offset, least)) return false;
@@ -196,8 +200,9 @@ bool MarkedEntries::IndexReader::findFields() {
   return found_ == header.fieldCount;
 }
 
-// Looks at the fields of one bucket. The first is at `offset`; 0: the bucket is empty. Counting all
-// fields ends a circle and shows afterwards whether one was missed.
+// Looks at the fields of one bucket. The first is at `offset`; 0: the bucket is empty. We count the
+// fields of all buckets: the count ends a circle of links, and shows in the end whether we missed a
+// field.
 bool MarkedEntries::IndexReader::followBucket(uint64_t offset) {
   std::array<uint8_t, kFieldHeaderSize + kMaxFieldNameLength> bytes;
   while (offset != 0) {
@@ -215,8 +220,10 @@ bool MarkedEntries::IndexReader::followBucket(uint64_t offset) {
   return true;
 }
 
-// If a companion stood in an entry without the field, the field's lists alone would hide that
-// entry. The counts show it without reading the companions' lists.
+// The field's lists would hide an entry that has a companion but not the field. If field and
+// companion have different counts, there is such an entry or the reverse, and we do not use the
+// index. Only the companions' lists could show that equal counts mean the same entries; reading
+// them would cost what the index saves.
 bool MarkedEntries::IndexReader::take(const EntryMark& mark) {
   uint64_t entries = 0;
   if (!takeValues(mark.field, mark.value, true, entries)) return false;
@@ -226,9 +233,10 @@ bool MarkedEntries::IndexReader::take(const EntryMark& mark) {
   });
 }
 
-// Looks at the values of a field, the newest first. Counts the entries that refer to them and, if
-// `listed`, takes their lists. A compressed value does not begin with the name, so a file that has
-// one is read without its index.
+// Follows the values of the field `name`, the newest first. Adds to `entries` how many entries have
+// one of them; if `value` is not empty, only that value counts. If `listed`, follows their lists
+// too. A compressed value does not begin with the field's name, so one such value makes this return
+// false.
 bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_view value,
                                             bool listed, uint64_t& entries) {
   const size_t headerSize = file_.dataHeaderSize();
@@ -257,7 +265,8 @@ bool MarkedEntries::IndexReader::takeValues(std::string_view name, std::string_v
   return true;
 }
 
-// The first entry stands in the value itself: most values occur once and then need no array.
+// The data object itself names its first entry, because most values occur once and then need no
+// array.
 bool MarkedEntries::IndexReader::addList(const uint8_t* data, uint64_t entries) {
   if (lists_.size() == kMaxLists) return false;
   const auto first = load<uint64_t>(data + kDataFirstEntryAt);
@@ -275,14 +284,14 @@ std::unique_ptr<MarkedEntries> MarkedEntries::of(JournalFile& file,
   auto marked = std::make_unique<MarkedEntries>();
   marked->lists_ = reader.lists();
   if (marked->lists_.size() > listsLeft) return nullptr;
-  listsLeft -= marked->lists_.size();  // not given back: files of a store are opened together
+  listsLeft -= marked->lists_.size();  // not given back: all files are opened before one ends
   marked->nearest_ = kNone;
   for (const List& list : marked->lists_) marked->nearest_ = std::min(marked->nearest_, list.next);
   return marked;
 }
 
-// Called only for an entry at or behind the nearest listed one. If it is behind, the listed offset
-// held no entry.
+// `offset` is the nearest listed offset or greater. If it is greater, the reader met no entry at
+// the listed offset, so that offset is wrong.
 bool MarkedEntries::look(uint64_t offset) {
   missed_ = nearest_ < offset;
   usable_ = !missed_;
@@ -294,9 +303,9 @@ bool MarkedEntries::look(uint64_t offset) {
   return true;
 }
 
-// False if the list is damaged or longer or shorter than its value says. We look one entry further
-// than we need: an offset that is too large would otherwise hide all marked entries up to it, until
-// the reader gets there.
+// Reads one entry further than we need. An offset that is too large would hide all marked entries
+// up to it; the smaller offset behind it shows the damage before that happens. False if the list is
+// damaged, or longer or shorter than its value says.
 bool MarkedEntries::lookAhead(List& list) {
   const uint64_t ahead = list.rest.next();
   const bool more = list.left != 0;

@@ -1,23 +1,23 @@
 // The index of a journal file: which entries it has, and which of them have a certain field.
 //
-// EntryChain reads a chain of entry arrays. One chain lists all entries of a file, and each data
-// object has one that lists the entries which refer to it. Offsets in a chain rise. A piece of a
-// chain that breaks this rule is not used at all, and a broken link ends the chain; the caller
-// learns that entries may be missing before the next one, and searches there.
+// EntryChain reads a chain of entry arrays. One chain lists all entries of a file. Each data object
+// has a chain too, which lists the entries that refer to it. The offsets in a chain rise.
+// EntryChain drops every piece that breaks this rule, and it ends at a broken link. It tells the
+// caller where entries may be missing, and the caller searches there.
 //
-// MarkedEntries says which entries are worth looking into. Most entries of a day are not, and to
-// read the fields of all would be most of the work. So it follows the lists of the few values that
-// matter, and of all other entries the reader reads the header alone.
+// MarkedEntries finds the entries that have a mark (see EntryMark). Few entries of a day have one,
+// and reading the fields of all entries would be most of the work. MarkedEntries follows the lists
+// of the few values that are marks. The reader reads only the header of every other entry.
 //
-// The danger: a wrong index hides entries without a word. So the index is used only if
+// A wrong index would hide entries, and nobody would notice. So we use it only if
 //   - the file is closed, because a writer links an entry in several steps;
-//   - as many fields are found as the header counts;
-//   - each value of a field is older than the one that links to it, which rules out circles;
-//   - companions stand in as many entries as the field that they accompany.
-// While it is followed, each list must be as long as its value says, must rise, and each listed
-// entry must be met. If one of these fails, every further entry is looked into. A wrong offset in a
-// list can then hide one entry, the one that it replaced. Looking up each entry in the lists of its
-// values would find even that, but reads the fields that this saves.
+//   - we find as many fields as the header counts;
+//   - each value of a field links to an older value, which rules out circles;
+//   - each companion has as many entries as the field that it accompanies.
+// While we follow the lists, three more things must hold: a list is as long as its value says, its
+// offsets rise, and the reader meets each listed entry. If one of them fails, the reader looks into
+// every further entry. Even then a wrong offset in a list can hide the entry that it replaced. To
+// find that entry, we would have to read the fields of every entry, which is what the index spares.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -35,12 +35,12 @@ namespace tessel {
 
 class EntryChain {
  public:
-  // Bytes that are read at once, at most: 512 entries for one system call, and little beside the
-  // window of the file.
+  // The most bytes of an array that are read at once. They hold 512 entries, so system calls are
+  // rare, and they are few beside the window of the file.
   static constexpr size_t kLargestPiece = 4096;
 
-  // The chain that begins with the array at offset `first` and should list `count` entries. `file`
-  // must outlive the chain.
+  // Reads the chain that begins with the array at offset `first` and should list `count` entries.
+  // `file` must outlive the chain.
   EntryChain(JournalFile& file, uint64_t first, uint64_t count,
              size_t largestPiece = kLargestPiece);
 
@@ -51,8 +51,8 @@ class EntryChain {
       return firstOfNextPiece();
     return last_ = itemAt(pieceNext_++);
   }
-  // Whether the chain is damaged before the entry that next() returned, so that entries may be
-  // missing there; and the offset of the damage.
+  // Whether the chain is damaged just before the entry that next() returned last. Entries may be
+  // missing there. problemAt() is the offset of the damage.
   bool gapBefore() const { return gapBefore_; }
   uint64_t problemAt() const { return problemAt_; }
 
@@ -79,35 +79,39 @@ class EntryChain {
   std::unique_ptr<uint8_t[]> piece_;  // null until the first piece is read
   size_t pieceSize_ = 0;              // in items
   size_t pieceNext_ = 0;
-  uint64_t array_ = 0;       // offset of the array that is read; 0: none is left
+  uint64_t array_ = 0;       // offset of the array that is being read; 0: none is left
   uint64_t nextArray_ = 0;   // offset of the array that it links to
   uint64_t arraySize_ = 0;   // in items
   uint64_t arrayIndex_ = 0;  // items of the array that were read
   uint64_t listed_ = 0;      // items read in all arrays
-  uint64_t last_ = 0;        // what next() returned last
-  bool gap_ = false;         // damage was met since then
+  uint64_t last_ = 0;        // the entry that next() returned last
+  bool gap_ = false;         // damage was found behind last_
   bool gapBefore_ = false;
   uint64_t problemAt_ = 0;
 };
 
 class MarkedEntries {
  public:
-  // Lists that all files of a store together follow at once. Each holds a piece of up to 1 KiB, so
-  // they take up to 4 MiB. Files that come later are read without their index.
+  // The most lists that all files of a store together may follow. Each list holds a piece of up to
+  // 1 KiB, so all take up to 4 MiB. When none is left, the further files are read without their
+  // index.
   static constexpr size_t kMaxListsOfStore = 4096;
 
-  // Reads the index of `file`, which must outlive the result, and takes its lists from `listsLeft`.
-  // Null if every entry must be looked into: `marks` is empty, the index does not hold, there are
-  // too many values or not enough lists left, or `stop` was set.
+  // Reads the index of `file`, which must outlive the result, and subtracts the lists that it uses
+  // from `listsLeft`. Null if the reader must look into every entry: because `marks` is empty, the
+  // file is being written, the index is damaged, it has too many fields or values, `listsLeft` is
+  // too small, or `stop` was set.
   static std::unique_ptr<MarkedEntries> of(JournalFile& file, std::span<const EntryMark> marks,
                                            size_t& listsLeft, const StopFlag& stop);
 
-  // Whether the entry at `offset` has a mark. REQUIRES: the caller asks about every entry of the
-  // file, in order, until usable() returns false.
+  // Whether the reader must look into the entry at `offset`: it has a mark, or a list was just
+  // found wrong. REQUIRES: the caller asks about every entry of the file, in order, until usable()
+  // returns false.
   bool has(uint64_t offset) { return offset >= nearest_ && look(offset); }
-  // False: the lists are damaged behind the last marked entry.
+  // False if the lists are damaged from here on. The caller must then look into every further
+  // entry.
   bool usable() const { return usable_; }
-  // Whether a list named an offset that is no entry. An entry may have been passed over there.
+  // Whether a list named an offset where no entry is. A marked entry may then have been hidden.
   bool missed() const { return missed_; }
   // Whether an entry is listed that the caller has not asked about yet.
   bool awaitsMore() const { return nearest_ != kNone; }

@@ -12,7 +12,8 @@ namespace tessel {
 
 namespace {
 constexpr Id128 kNoId{};
-// Greater than every number of a file, so that one number says which of the two it is.
+// all_ merges files and whole sequences. A stream number below this is a file's; one from here on
+// is a sequence's. No store has so many files.
 constexpr uint32_t kFirstSequence = 0x80000000;
 }  // namespace
 
@@ -21,8 +22,8 @@ bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
       a.sequenceNumber != b.sequenceNumber)
     return a.sequenceNumber < b.sequenceNumber;
   if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
-  // Hash and boot decide between equal times, so that the order does not depend on which file was
-  // opened first and two runs over one store agree.
+  // Hash and boot decide between equal times. Otherwise the order would depend on which file was
+  // opened first, and two runs over one store could differ.
   return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
          std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
 }
@@ -42,7 +43,7 @@ void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
 
 bool EntryMerger::next() {
   if (started_ && !heap_.empty()) {
-    // Copies are skipped before the front moves on, because they are compared with its entry.
+    // The copies go first: they are compared with the front, so it must not have moved on yet.
     dropDuplicates();
     advanceFirst();
   } else if (!started_) {
@@ -88,10 +89,10 @@ void EntryMerger::siftDown(size_t index) {
   }
 }
 
-// Skips the current entry in all other streams, at most once in each: a stream that has it twice
-// was written twice. A copy compares equal to the front, so in a heap nothing but another copy can
-// stand between them. It is enough to look at the two places below the front: when a copy there is
-// skipped, siftDown() brings up what was below it.
+// Skips the copies of the current entry in the other streams. A stream skips at most one: if it has
+// the entry twice, the entry was written twice. A copy compares equal to the front, so in a heap
+// nothing but another copy can stand between them. Therefore we look only at the two places below
+// the front: when we skip a copy there, siftDown() brings up the entry below it.
 void EntryMerger::dropDuplicates() {
   for (size_t child = 1; child <= 2 && child < heap_.size();) {
     if (heap_[child].skippedFor == current_ ||
@@ -116,8 +117,8 @@ bool StoreMerger::next() {
   return all_.next();
 }
 
-// Files of no known sequence, and a file that is the only one of its sequence, need no merger of
-// their own.
+// A sequence gets its own merger only if it has several files. A file that may hold several
+// sequences goes to all_ directly: numbers alone do not order its entries.
 void StoreMerger::start() {
   for (auto& [sequence, streams] : std::exchange(waiting_, {})) {
     if (sequence != Id128{} && streams.size() > 1) {

@@ -1,16 +1,20 @@
 // Merging: many entry streams as one, in the journal's own order, each entry once.
 //
-// Which of two entries comes first? If both count in the same sequence, the one with the lower
-// number: the daemon gave the numbers, so this is always right. Otherwise, if both are of one boot,
-// the earlier one by the monotonic clock. Otherwise the earlier one by the wall clock.
+// A daemon numbers its entries in a row, a sequence, which goes on from file to file. Which of two
+// entries comes first? If they belong to one sequence, the lower number comes first; the daemon
+// gave the numbers, so this is always right. Otherwise, if both are of one boot, the monotonic
+// clock decides. Otherwise the wall clock decides.
 //
-// Taken together these rules are no order. With one entry of another sequence between two numbers,
-// and a clock that was set back, A can come before B, B before C, and C before A. A merge then
-// still delivers every entry, but copies of one entry, which stand in an archived file and in a
-// copy of it, may come up far apart, so that the merge does not see that they are equal. Therefore
-// StoreMerger first merges the files of each sequence, where numbers alone decide and copies always
-// meet, and only then the sequences. The price is one comparison more for each entry. Remembering
-// every entry that was delivered would also find the copies, but takes memory without bound.
+// These rules can contradict each other. If the clock was set back between A and B, A comes before
+// B by number; but an entry C of another sequence can come after B and before A by the clock. A
+// merge of all files at once would still deliver every entry. But a store may hold a file and a
+// copy of it. The two copies of an entry could then come up far apart, and the merge would not see
+// that they are equal.
+//
+// Therefore StoreMerger works in two steps. First it merges the files of each sequence: there the
+// numbers alone decide, and copies always meet. Then it merges the sequences. The price is one more
+// comparison for each entry. We could also find the copies if we remembered every entry, but that
+// takes memory without bound.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -28,21 +32,22 @@ namespace tessel {
 
 // Whether `a` comes before `b`.
 bool comesBefore(const EntryHeader& a, const EntryHeader& b);
-// Whether both are copies of one entry. An entry without a sequence or a hash has no copies: two
-// like it cannot be told from two different entries, and showing one twice loses nothing.
+// Whether both are copies of one entry. False if one has no sequence or no hash: then we cannot
+// tell two copies from two different entries, and delivering an entry twice loses nothing.
 bool sameEntry(const EntryHeader& a, const EntryHeader& b);
 
-// Merges streams with a heap. An entry that stands in several streams is delivered once, as long as
-// the order of these streams does not run in a circle. Equal entries of one stream are all
-// delivered, because they are entries that were written twice.
+// Merges streams with a heap. It delivers an entry of several streams once, unless the rules above
+// contradict each other for these streams. If one stream has equal entries, it delivers them all:
+// they were written more than once.
 class EntryMerger final : public EntryStream {
  public:
-  // Counts in `duplicates` the copies that it leaves out. Both must outlive the merger.
+  // Adds to `duplicates` each copy that it leaves out. `stop` and `duplicates` must outlive the
+  // merger.
   EntryMerger(const StopFlag& stop, uint64_t& duplicates) : stop_(stop), duplicates_(duplicates) {}
 
-  // Adds a stream. It is asked for its first entry at once and destroyed after its last, which
-  // closes its file and leaves more of the window budget to the others.
-  // REQUIRES: next() was not called.
+  // Adds a stream and asks it for its first entry at once. The merger destroys a stream after its
+  // last entry: that closes the file and leaves more of the window budget to the others. REQUIRES:
+  // next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
   bool next() override;
@@ -86,8 +91,8 @@ class StoreMerger final : public EntryStream {
   // `stop` must outlive the merger.
   explicit StoreMerger(const StopFlag& stop) : stop_(stop), all_(stop, duplicates_) {}
 
-  // Adds a stream whose entries all count in `sequence`. All zero: they may count in any.
-  // REQUIRES: next() was not called.
+  // Adds a stream whose entries all belong to `sequence`. If `sequence` is all zero, they may
+  // belong to any sequences or to none. REQUIRES: next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence);
 
   bool next() override;
@@ -95,7 +100,7 @@ class StoreMerger final : public EntryStream {
   Entry entry() override { return all_.entry(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
   uint32_t streamNumber() const;
-  // How many copies of entries were left out.
+  // How many copies of entries it left out so far.
   uint64_t duplicates() const { return duplicates_; }
 
  private:

@@ -28,8 +28,10 @@ namespace {
 
 constexpr std::string_view kEntryStart = "\n\n__CURSOR=";
 constexpr std::string_view kEntryEnd = "\n\n";
-// Bytes at the end of a file that are searched for the last entry: at first enough for a usual one,
-// at most enough for the largest that a reader keeps, with room to spare.
+// Bytes. We look for the last entry at the end of the file. kFirstLook holds a usual entry; each
+// further look takes four times as much. After a look of more than kLastLook, four times what a
+// reader keeps of an entry, we give up. The new entry then begins a sequence of its own, and
+// readers cannot tell whether entries before it are missing.
 constexpr off_t kFirstLook = off_t{64} * 1024;
 constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
 constexpr const char* kSocket = "/run/systemd/journal/socket";
@@ -50,8 +52,9 @@ PlatformError failure(const std::string& path, const std::string& doing, int err
   return fileError("Cannot " + doing + " " + path, error);
 }
 
-// The daemon's hash depends on the file. Ours (FNV-1a) only has to be the same for equal entries,
-// so that a copied export file shows them as copies. XOR makes the order of the fields irrelevant.
+// Our hash (FNV-1a) is not the daemon's, and need not be. It only has to be equal for equal
+// entries, so that the merge recognises the entries of a copied export file as copies. XOR makes
+// the order of the fields irrelevant.
 uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
   uint64_t all = 0;
   for (const RecordedField& field : fields) {
@@ -65,8 +68,8 @@ uint64_t contentHashOf(const std::vector<RecordedField>& fields) {
 }
 
 void appendField(std::string& out, std::string_view name, std::string_view value) {
-  // A newline would end the field and other control characters garble a terminal, so a value with
-  // any of them is written with its length.
+  // A newline would end the field, and other control characters garble a terminal. So a value with
+  // any of them is written with its length in front.
   const bool text = std::none_of(value.begin(), value.end(),
                                  [](char c) { return static_cast<uint8_t>(c) < ' ' && c != '\t'; });
   out += name;
@@ -91,14 +94,14 @@ std::string readAt(int fd, off_t offset, size_t count) {
 
 Id128 randomId() {
   Id128 id{};
-  // The kernel never returns fewer than it was asked for if that is at most 256 bytes.
+  // The result is not checked: the kernel never returns fewer bytes than were asked for, up to 256.
   static_cast<void>(::getrandom(id.data(), id.size(), 0));
   return id;
 }
 
 // The header of the last entry in `tail`, which may begin within an entry.
 std::optional<EntryHeader> lastEntryIn(std::string_view tail) {
-  // A value may hold what looks like the start of an entry, so only a whole cursor counts.
+  // A value may hold text that looks like the start of an entry, so only a whole cursor counts.
   for (size_t at = tail.rfind(kEntryStart); at != std::string_view::npos;
        at = at == 0 ? std::string_view::npos : tail.rfind(kEntryStart, at - 1)) {
     std::string_view cursor = tail.substr(at + kEntryStart.size());
@@ -125,7 +128,8 @@ std::optional<PlatformError> appendLocked(int fd, const std::string& path,
   struct stat status {};
   if (::fstat(fd, &status) != 0) return failure(path, "look at", errno);
   EntryHeader header;
-  // All entries of one file count in one sequence, so that readers can tell which are missing.
+  // All entries of one file belong to one sequence, so that readers can tell whether some are
+  // missing.
   const std::optional<EntryHeader> last = lastEntry(fd, status.st_size);
   header.sequenceId = last ? last->sequenceId : randomId();
   header.sequenceNumber = last ? last->sequenceNumber + 1 : 1;
@@ -140,7 +144,7 @@ std::optional<PlatformError> appendLocked(int fd, const std::string& path,
     text.insert(0, kEntryEnd);
   }
   if (writeAll(fd, text)) return std::nullopt;
-  // Half an entry would stay incomplete forever, so what was written is taken back.
+  // Readers would wait for the rest of half an entry, so we take back the part that was written.
   const int error = errno;
   if (::ftruncate(fd, status.st_size) != 0)
     return failure(path, "take back half an entry in", errno);
@@ -157,7 +161,7 @@ RecordOrigin currentOrigin() {
   std::error_code error;
   const auto image = std::filesystem::read_symlink("/proc/self/exe", error);
   if (!error) origin.imagePath = image.string();
-  // The daemon takes these from the kernel too, so a recorded entry looks like a received one.
+  // The daemon takes these two from the kernel too, so our entry looks like one of its own.
   origin.processName = firstLineOf("/proc/self/comm");
   origin.process = std::to_string(::getpid());
   return origin;
@@ -189,7 +193,8 @@ std::optional<PlatformError> appendToExportFile(const std::string& directory,
   }
   const UniqueFd file(::open(path.c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
   if (!file.valid()) return failure(path, "open", errno);
-  // Sequence numbers come from the last entry: between looking and writing nobody else may append.
+  // The sequence number follows that of the last entry, so nobody else may append between our look
+  // at the file and our write. The lock ends when the descriptor is closed.
   while (::flock(file.get(), LOCK_EX) != 0) {
     if (errno != EINTR) return failure(path, "lock", errno);
   }
@@ -197,7 +202,7 @@ std::optional<PlatformError> appendToExportFile(const std::string& directory,
 }
 
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields) {
-  // The library returns success if there is no daemon.
+  // The library returns success if there is no daemon, so we ask first whether its socket is there.
   if (::access(kSocket, W_OK) != 0) return failure(kSocket, "write to the journal at", errno);
   std::vector<std::string> texts;
   texts.reserve(fields.size());

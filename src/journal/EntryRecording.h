@@ -1,7 +1,7 @@
 // Recording an entry: to the journal daemon, or to an export file where no daemon runs.
 //
-// Any number of processes may append to one export file. Each entry is written whole, under a lock
-// of the file. What the daemon would have added to the entry comes from the caller.
+// Any number of processes may append to one export file: each writes a whole entry while it holds a
+// lock on the file. There is no daemon to add time, boot and process, so the caller supplies them.
 //
 // Threads: any, at the same time.
 
@@ -22,32 +22,33 @@ struct RecordedField {
   std::string value;
 };
 
-// What the journal daemon adds to an entry. What is absent does not appear in the entry.
+// The fields that the journal daemon would add to an entry. An absent one is left out.
 struct RecordOrigin {
   uint64_t realtime = 0;   // microseconds since 1970
   uint64_t monotonic = 0;  // microseconds since boot
   Id128 boot{};
   std::optional<std::string> imagePath;
   std::optional<std::string> processName;
-  std::optional<std::string> process;
+  std::optional<std::string> process;  // its id, in decimal
 };
 
 // The calling process, now.
 RecordOrigin currentOrigin();
 
-// The entry in the Journal Export Format, with its empty line.
+// The entry in the Journal Export Format, with the empty line that ends it.
 std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
                        const std::vector<RecordedField>& fields);
 
-// Appends one entry to `<directory>/tessel.export` and makes both if they do not exist; or to
-// `directory` itself if it names an `.export` file. After an error, which names the path and the
-// reason, nothing was appended.
+// Appends one entry to `<directory>/tessel.export` and makes both if they do not exist. If
+// `directory` ends in `.export`, it is the file itself. An error names the path and the reason.
+// After an error nothing was appended, except when it says that half an entry could not be taken
+// back: the next append then ends that half, and readers report it as damage.
 std::optional<PlatformError> appendToExportFile(const std::string& directory,
                                                 const RecordOrigin& origin,
                                                 const std::vector<RecordedField>& fields);
 
-// Hands one entry to the journal daemon of this machine. No daemon is an error too, although the
-// system's own library takes it for success.
+// Hands one entry to the journal daemon of this machine. It is an error if there is no daemon; the
+// system's own library would return success.
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields);
 
 }  // namespace tessel

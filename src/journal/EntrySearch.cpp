@@ -1,4 +1,5 @@
-// Two steps in turns: follow sizes from object to object, and find the next object after damage.
+// Two steps that alternate: follow the sizes from object to object, and find the next object after
+// damage.
 
 #include "journal/EntrySearch.h"
 
@@ -14,7 +15,7 @@ using namespace journal_format;
 EntrySearch::EntrySearch(JournalFile& file, uint64_t start, uint64_t end, const StopFlag& stop)
     : file_(file), stop_(stop), start_(start), end_(end), position_(start) {}
 
-// Behind header().lastObject a file that is being written holds objects that are not finished.
+// While a file is being written, an object behind header().lastObject may be unfinished.
 bool EntrySearch::mayHoldObject(uint64_t offset) const {
   const uint64_t end = searchEnd();
   return offset <= file_.header().lastObject && offset < end && end - offset >= kObjectHeaderSize;
@@ -22,16 +23,17 @@ bool EntrySearch::mayHoldObject(uint64_t offset) const {
 
 std::optional<ObjectHeader> EntrySearch::objectAt(uint64_t offset) {
   if (!mayHoldObject(offset)) return std::nullopt;
-  // Computed first: reading may find that the file was cut before `offset`, and then this
-  // difference would be negative.
+  // Computed before at(): reading may find that the file was cut before `offset`. searchEnd() then
+  // moves, and this difference would be negative.
   const uint64_t room = searchEnd() - offset;
   const uint8_t* at = file_.file().at(offset, kObjectHeaderSize);
   if (at == nullptr) return std::nullopt;
   return file_.objectHeader({at, kObjectHeaderSize}, room);
 }
 
-// A damaged size may point anywhere. Moving the window there and back for each candidate would read
-// the window's size again and again, so this reads sixteen bytes without it.
+// A damaged size may point anywhere. If the window went there and back for each candidate, we would
+// read it whole again and again. So we read only the sixteen bytes of the header, without moving
+// the window.
 bool EntrySearch::objectBeginsAt(uint64_t offset) {
   if (!mayHoldObject(offset)) return false;
   std::array<uint8_t, kObjectHeaderSize> bytes;
@@ -67,8 +69,9 @@ void EntrySearch::noteDamage(uint64_t offset) {
   if (damagedPlaces_++ == 0) firstDamage_ = offset;
 }
 
-// Finds the next object if there is none at `offset`. It may lie before `offset`: then the size of
-// the last object was wrong. False if only zeros are left, which is how an unused end looks.
+// Finds the next object if there is none at `offset`. It may lie before `offset`, if the size of
+// the last object was wrong. False if there is no further object. If only zeros are left, that is
+// no damage: the daemon allocates more than it fills.
 bool EntrySearch::resynchronise(uint64_t offset) {
   if (offset >= onlyZerosFrom()) return false;
   noteDamage(offset);
@@ -83,7 +86,7 @@ bool EntrySearch::resynchronise(uint64_t offset) {
   return false;
 }
 
-// Whether an object begins at `offset` and whether it is followed by what may follow an object.
+// Whether an object begins at `offset` and something follows it that may follow an object.
 bool EntrySearch::makesSense(uint64_t offset) {
   const auto object = objectAt(offset);
   if (!object) return false;
@@ -93,8 +96,8 @@ bool EntrySearch::makesSense(uint64_t offset) {
 
 uint64_t EntrySearch::searchEnd() const { return std::min(end_, file_.objectsEnd()); }
 
-// Where the zeros begin that reach to the end of the part. Following the size of each candidate
-// through the zeros behind it would take the square of the file's size, so this is found once.
+// The offset from which the part holds nothing but zeros. We look for it once and keep it. If we
+// looked at the zeros behind each candidate, damage could cost the square of the file's size.
 uint64_t EntrySearch::onlyZerosFrom() {
   if (onlyZerosFrom_) return *onlyZerosFrom_;
   uint64_t from = start_;
@@ -110,8 +113,8 @@ uint64_t EntrySearch::onlyZerosFrom() {
   return *(onlyZerosFrom_ = from);
 }
 
-// The eight-byte words from `offset` on that the window holds. Nothing at the end, or soon after
-// the stop flag was set.
+// The eight-byte words from `offset` to the end of the window. Nothing at the end of the part, or
+// soon after the stop flag was set.
 std::optional<std::span<const uint8_t>> EntrySearch::wordsAt(uint64_t offset) {
   const uint64_t end = searchEnd();
   if (offset >= end || end - offset < 8 || stop_.load(std::memory_order_relaxed) ||
@@ -122,7 +125,8 @@ std::optional<std::span<const uint8_t>> EntrySearch::wordsAt(uint64_t offset) {
                      ~size_t{7});
 }
 
-// The offset of the next eight-byte word that is not zero: an object's first word holds its type.
+// The offset of the next eight-byte word that is not zero. An object begins with its type, so it
+// cannot begin with a zero word.
 std::optional<uint64_t> EntrySearch::nextNonZero(uint64_t offset) {
   while (const auto words = wordsAt(offset)) {
     for (size_t at = 0; at < words->size(); at += 8)

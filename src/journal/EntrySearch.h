@@ -1,17 +1,19 @@
-// EntrySearch: finds entries in a part of a journal file object by object, without the list of
-// entries.
+// EntrySearch: finds entries in a part of a journal file without the list of entries, by looking at
+// every object.
 //
-// The reader uses it where an entry array is damaged. It steps from object to object by their
-// sizes. If there is no valid object where one should begin, the size of the last object may have
-// been wrong. The search then goes back to just behind the header of that object and tries every
-// eighth byte, because objects begin at multiples of eight. Random bytes often look like an object,
-// so a place counts only if the object there is followed by another one, by zeros up to the end, or
-// by the end of what was written. Asking for three objects in a row would find less behind damage;
-// asking for one finds entries that never were.
+// The reader uses it where an entry array is damaged. The search steps from object to object by
+// their sizes. If there is no valid object where one should begin, the size of the last object may
+// have been wrong. The search then goes back to just behind the header of that object and tries
+// every eighth byte, because objects begin at multiples of eight.
 //
-// It guarantees: entries come in rising order, each once; and the time is proportional to the size
-// of the part, whatever the file holds, because it never goes back behind an object that it
-// accepted and looks for the zeros at the end only once.
+// Random bytes often look like an object. So a place counts only if the object there is followed by
+// another object, by zeros up to the end, or by the end of what was written. If we asked for three
+// objects in a row, we would find fewer entries behind damage. If we asked for one alone, we would
+// find entries that never existed.
+//
+// It delivers entries in rising order, each once. Its time is proportional to the size of the part,
+// whatever the file holds: it never goes back before an object that it accepted, and it looks for
+// the zeros at the end only once.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -33,7 +35,8 @@ class EntrySearch {
 
   // The offset of the next entry. Nothing at the end, or soon after the stop flag was set.
   std::optional<uint64_t> next();
-  // How often no valid object was where one should be, and the first offset where that happened.
+  // In how many places there was no valid object or entry where one should be; firstDamage() is the
+  // offset of the first such place.
   uint64_t damagedPlaces() const { return damagedPlaces_; }
   uint64_t firstDamage() const { return firstDamage_; }
 

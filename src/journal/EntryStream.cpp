@@ -10,6 +10,7 @@ namespace tessel {
 namespace {
 
 std::string hexadecimal(uint64_t value) {
+  // 64 bits have at most 16 digits, so to_chars() cannot fail.
   char buffer[16];
   const auto [end, error] = std::to_chars(buffer, buffer + sizeof buffer, value, 16);
   return {buffer, end};
@@ -39,6 +40,7 @@ bool readPart(EntryHeader& header, char part, std::string_view value) {
 }  // namespace
 
 bool parseNumber(std::string_view text, int base, uint64_t& out) {
+  // from_chars() also accepts a number with other text behind it, so we compare where it stopped.
   const char* end = text.data() + text.size();
   const auto [at, error] = std::from_chars(text.data(), end, out, base);
   return error == std::errc() && at == end;
@@ -74,8 +76,8 @@ std::string cursorOf(const EntryHeader& header) {
          ";t=" + hexadecimal(header.realtime) + ";x=" + hexadecimal(header.contentHash);
 }
 
-// The parts must come in journalctl's order, each once. A looser reader would accept text of log
-// values that only looks like a cursor, and the recorder would continue a wrong sequence.
+// The parts must come in journalctl's order, each once. Otherwise text in a log value would sooner
+// pass for a cursor, and the recorder would continue a wrong sequence.
 std::optional<EntryHeader> parseCursor(std::string_view cursor) {
   constexpr std::string_view kParts = "sibmtx";
   EntryHeader header;

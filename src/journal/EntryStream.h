@@ -1,9 +1,10 @@
 // EntryStream: journal entries, one after another, with their fields as small integers.
 //
 // A journal stores each distinct FIELD=value once, and entries refer to it. We use this: a reader
-// shows each distinct text once to a FieldTokenizer, which parses it and returns a token. From then
-// on the reader only compares and copies integers; an entry is a header and a list of tokens.
-// Fields of no interest have the token kNoToken and do not appear in the list.
+// shows a text to a FieldTokenizer, which parses it and returns a token. When the reader meets the
+// same text again, it usually still knows the token and only copies an integer. So an entry is a
+// header and a list of tokens. Fields of no interest have the token kNoToken and are left out of
+// the list.
 //
 // Threads: one at a time, except for StopFlag.
 
@@ -39,13 +40,15 @@ inline bool sameId(const Id128& a, const Id128& b) {
 
 // Bytes. The journal takes no longer names, so a text without '=' in its first 65 bytes is damaged.
 inline constexpr size_t kMaxFieldNameLength = 64;
-// Bytes. The longest value that a tokenizer is shown whole; of longer ones it sees the beginning.
+// Bytes. A tokenizer sees a value of at most this length whole, and only the beginning of a longer
+// one.
 inline constexpr size_t kMaxFieldValueLength = 4096;
-// Name, '=', value, and one byte more that tells a value that was cut.
+// Name, '=', value, and one more byte, which shows that a longer value was cut.
 inline constexpr size_t kMaxFieldHead = kMaxFieldNameLength + 1 + kMaxFieldValueLength + 1;
 
-// A field that makes an entry worth showing. Its companions do so too, but they nearly always stand
-// in the same entries as the field. A reader that has checked this follows the field alone.
+// A field that makes an entry worth reading: the entry has a mark. Companions are further fields
+// that do so. They nearly always stand in the same entries as the field, so a reader that has
+// compared their counts follows the field alone.
 struct EntryMark {
   std::string_view field;
   std::string_view value = {};  // only this value counts; empty: any value does
@@ -56,8 +59,8 @@ struct EntryMark {
 class FieldTokenizer {
  public:
   virtual ~FieldTokenizer() = default;
-  // What makes an entry worth showing; empty: every entry is. A reader that knows from the file's
-  // index which entries have a mark may deliver the others without tokens.
+  // The marks of the entries that the user needs; empty: it needs every entry. A reader that knows
+  // from the file's index which entries have a mark may deliver the others without tokens.
   virtual std::vector<EntryMark> marks() const { return {}; }
   // Whether a field of this name can ever have a token. Asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
@@ -97,13 +100,13 @@ class EntryStream {
   virtual ~EntryStream() = default;
   // Moves to the next entry. False at the end, or soon after the stop flag was set.
   virtual bool next() = 0;
-  // Both REQUIRE that the last next() returned true. header() costs nothing; entry() collects the
-  // tokens, so who only counts or skips an entry does not call it.
+  // Both REQUIRE that the last next() returned true. header() costs nothing. entry() collects the
+  // tokens, so a caller that only counts or skips the entry does not call it.
   virtual const EntryHeader& header() const = 0;
   virtual Entry entry() = 0;
 };
 
-// The cursor of an entry, its place as a text that `journalctl --cursor=` takes:
+// The cursor of an entry: a text that identifies the entry and that `journalctl --cursor=` accepts.
 // "s=<sequence id>;i=<number>;b=<boot id>;m=<monotonic>;t=<realtime>;x=<content hash>", in
 // hexadecimal.
 std::string cursorOf(const EntryHeader& header);
@@ -114,7 +117,8 @@ std::optional<EntryHeader> parseCursor(std::string_view cursor);
 // Reads 32 hexadecimal digits, with or without the dashes of a UUID; nothing for other texts.
 std::optional<Id128> parseId128(std::string_view text);
 std::string textOf(const Id128& id);
-// Sets `out` if the whole of `text` is a number without sign in `base`; otherwise returns false.
+// Sets `out` and returns true if the whole of `text` is a number in `base`, without a sign.
+// Otherwise returns false; `out` may have changed then.
 bool parseNumber(std::string_view text, int base, uint64_t& out);
 
 }  // namespace tessel

@@ -23,7 +23,8 @@ namespace tessel {
 
 namespace {
 
-// Bytes. A longer line is read in pieces: the window does not grow for the part that nobody sees.
+// Bytes. The tokenizer sees no more of a line. So we read a longer line in pieces, and the window
+// need not grow for it.
 constexpr size_t kLongLine = kMaxFieldHead;
 
 bool isFieldName(std::string_view name) {
@@ -73,13 +74,14 @@ void ExportEntryStream::startEntry() {
   entryPlace_ = window_.place();
 }
 
+// How much this stream takes, with `added` more bytes, of the memory that all streams share.
 size_t ExportEntryStream::keptBeyondUsual(size_t added) const {
   const size_t memory = kept_.size() + keptFields_.size() * sizeof(KeptField) + added;
   return memory - std::min(memory, kUsualEntry);
 }
 
-// Gives back what was kept. clear() keeps the memory of a string, so one large entry in each of
-// thousands of files would add up; only memory for a usual entry stays.
+// Forgets the fields of the entry. clear() alone would keep their memory, and one large entry in
+// each of thousands of files would add up. So only the memory of a usual entry stays.
 void ExportEntryStream::dropKept() {
   TESSEL_INVARIANT(resources_.bytesKept >= keptBeyondUsual(0));  // the streams' shares add up
   resources_.bytesKept -= keptBeyondUsual(0);
@@ -92,6 +94,7 @@ void ExportEntryStream::dropKept() {
 ExportEntryStream::Outcome ExportEntryStream::readEntry() {
   bool empty = true;
   for (Line line; readLine(line); empty = false) {
+    // Further empty lines are no entry. The recorder writes two to end half an entry.
     if (line.size == 0) return empty ? Outcome::skipped : finishEntry();
     const Outcome outcome = readField(line);
     if (outcome != Outcome::complete) return outcome;
@@ -106,8 +109,8 @@ ExportEntryStream::Outcome ExportEntryStream::finishEntry() {
   return Outcome::skipped;
 }
 
-// Reads up to the next newline; false if there is none yet. `searched` spares looking at the same
-// bytes again each time the window has grown.
+// Reads up to the next newline; false if there is none yet. The bytes before `searched` hold no
+// newline, so we do not look at them again each time the window has grown.
 bool ExportEntryStream::readLine(Line& line) {
   for (size_t searched = 0; searched <= kLongLine; searched = window_.bytes().size()) {
     if (!window_.fill(searched + 1)) return false;
@@ -146,14 +149,14 @@ ExportEntryStream::Outcome ExportEntryStream::readField(const Line& line) {
 }
 
 ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view name) {
-  // Copied, because filling the window for the value moves the name away.
+  // Copied, because fill() for the value may move the window, and `name` points into it.
   std::string head(name);
   head += '=';
   const uint64_t lengthPlace = window_.place();
   if (!window_.fill(8)) return Outcome::ended;
   const uint64_t length =
       journal_format::load<uint64_t>(reinterpret_cast<const uint8_t*>(window_.bytes().data()));
-  // Checked before the length is passed over: resynchronising then starts right here.
+  // Checked before consume(): the search for the next empty line then begins at the wrong length.
   if (length > kMaxValueLength) return bad("value longer than any");
   window_.consume(8);
   const auto shown = static_cast<size_t>(std::min<uint64_t>(length, kMaxFieldValueLength + 1));
@@ -169,9 +172,10 @@ ExportEntryStream::Outcome ExportEntryStream::readBinaryField(std::string_view n
   return takeField(nameLength, head, nameLength + 1 + length);
 }
 
-// After a wrong length the next empty line may lie within what was passed over, so we go back. All
-// ways back together are bounded by a multiple of what was read; otherwise a file of nothing but
-// wrong lengths would take the square of its size.
+// After a wrong length the next empty line may lie in the bytes that we took for the value, so we
+// go back to `place`. A file full of wrong lengths could make us read it as often as it has fields.
+// So all ways back together may be at most eight times as long as the file so far; after that we go
+// on behind the value, as we do in a pipe that cannot go back.
 void ExportEntryStream::goBackWithin(uint64_t place) {
   constexpr uint64_t kTimesOver = 8;
   const uint64_t distance = window_.place() - place;
@@ -190,7 +194,7 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   if (keptFields_.size() == kMaxFieldsKept || kept_.size() + head.size() > kMaxBytesKept) {
     return bad("entry with too many fields");
   }
-  // Refusing the entry here bounds memory; the entry is reported, and those of other files go on.
+  // Memory is bounded, so one of the entries must go. It is this one; the report names it.
   const size_t more = keptBeyondUsual(head.size() + sizeof(KeptField)) - keptBeyondUsual(0);
   if (resources_.bytesKept + more > kMaxBytesKeptByAll) {
     return bad("entry too large beside those of other files");
@@ -204,16 +208,16 @@ ExportEntryStream::Outcome ExportEntryStream::takeField(size_t nameLength, std::
   return Outcome::complete;
 }
 
-// Takes a field that says when the entry was written and where it stands. The cursor says all of
-// this, but writers that have only some of it leave the cursor out. It comes first in an entry, so
-// the other fields overwrite what it says.
+// Takes a field of the entry's header: its time, boot, sequence or number. The cursor holds all of
+// them, but some writers leave it out. It comes first in an entry, so the single fields overwrite
+// its parts.
 ExportEntryStream::Outcome ExportEntryStream::takeAddress(std::string_view name,
                                                           std::string_view value) {
   if (name == "__CURSOR") {
     if (const auto place = parseCursor(value)) header_ = *place;
   } else if (name == "__REALTIME_TIMESTAMP") {
-    // A second time means that the empty line between two entries was lost. Reading on would make
-    // one entry of both.
+    // A second timestamp means that the empty line between two entries was lost. If we read on, the
+    // fields of both would become one entry.
     if (hasRealtime_) return bad("two entries without an empty line between");
     if (!parseNumber(value, 10, header_.realtime)) return bad("invalid __REALTIME_TIMESTAMP");
     hasRealtime_ = true;
@@ -244,8 +248,8 @@ bool ExportEntryStream::resynchronise() {
   return false;
 }
 
-// Goes back to the beginning of an entry that is not complete, so that the next call reads it
-// again. It is counted once, however often the next call finds it still incomplete.
+// Goes back to the beginning of an incomplete entry, so that the next call of next() reads it
+// again. However often it is still incomplete, the report counts it once.
 void ExportEntryStream::waitAtEntry() {
   if (!window_.error().empty()) report_.addProblem("read error: " + window_.error(), entryPlace_);
   const bool stopped = stop_.load(std::memory_order_relaxed);
@@ -256,8 +260,8 @@ void ExportEntryStream::waitAtEntry() {
 }
 
 Entry ExportEntryStream::entry() {
-  // Tokens are made here and not in next(): the merge holds an entry of each file for a long time,
-  // and tokens may become void meanwhile.
+  // We make the tokens here and not in next(): the merge may hold an entry for a long time, and
+  // tokens become void when the tokenizer starts a new generation.
   resources_.tokens.clear();
   for (const KeptField& field : keptFields_) {
     const std::string_view head = std::string_view(kept_).substr(field.offset, field.length);
@@ -312,14 +316,16 @@ pid_t startJournalctl(const std::string& path, int output) {
 std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
     const std::string& path, uint64_t entryCount, ExportReadResources& resources,
     FieldTokenizer& tokenizer, const StopFlag& stop, FileReport& report) {
-  // Close-on-exec: a later child that holds our end open would keep this one from ever ending.
+  // Close-on-exec: if a later child inherited our end, this child would never learn that we stopped
+  // reading, and would wait forever to write.
   std::array<int, 2> ends{};
   if (::pipe2(ends.data(), O_CLOEXEC) != 0) return nullptr;
   UniqueFd input(ends[0]);
   const UniqueFd output(ends[1]);
   const pid_t child = startJournalctl(path, output.get());
   if (child == 0) return nullptr;
-  // Set from outside: the child cannot have read much yet, and spawn has no way to set them before.
+  // A spawn cannot set limits before the child runs, so we set them now. The child cannot have read
+  // much yet.
   limit(child, RLIMIT_CPU, kProcessorSeconds);
   limit(child, RLIMIT_AS, kMemory);
   return std::unique_ptr<ForeignJournalStream>(new ForeignJournalStream(
@@ -328,17 +334,18 @@ std::unique_ptr<ForeignJournalStream> ForeignJournalStream::start(
 
 ForeignJournalStream::~ForeignJournalStream() {
   if (child_ == 0) return;
-  // It may be waiting to write to a pipe that nobody reads, or be busy with damage: no reason to
-  // ask.
+  // The child may be busy with damage for minutes, and it has nothing to save. So we kill it.
   ::kill(child_, SIGKILL);
   endedWell(child_);
 }
 
 bool ForeignJournalStream::next() {
   if (entries_.next()) {
+    // A damaged header may count fewer entries than there are; the difference must not wrap.
     missing_ -= missing_ != 0;
     return true;
   }
+  // After a stop the child is still busy, and waiting for it would delay the stop.
   if (child_ == 0 || stop_.load(std::memory_order_relaxed)) return false;
   if (!endedWell(std::exchange(child_, 0))) report_.addProblem("journalctl failed", 0);
   // If journalctl does not know the layout either, it prints nothing and still exits with 0. The

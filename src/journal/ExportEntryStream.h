@@ -1,17 +1,17 @@
 // Entries in the Journal Export Format, from a file or a pipe.
 //
-// An entry is a row of lines and ends with an empty line. A line is NAME=value. If the value has
-// bytes that a line cannot hold, it is NAME, a newline, the length of the value as eight bytes, the
-// value, and a newline. Nothing is believed: an entry that breaks these rules is counted in the
-// report with its place, and reading goes on after the next empty line.
+// An entry has one line, NAME=value, for each field, and ends with an empty line. A value that a
+// line cannot hold is written differently: NAME, a newline, the length of the value in eight bytes
+// (little-endian), the value, and a newline. If an entry breaks these rules, the stream counts it
+// in the report with its place and goes on after the next empty line.
 //
-// Other processes may append meanwhile. An entry without its empty line is not complete yet, so a
-// stream that has ended reads it again at the next call of next(), and may then go on.
+// Other processes may append while we read. A last entry without its empty line is incomplete:
+// next() returns false, and the next call of next() reads that entry again.
 //
-// ForeignJournalStream has journalctl print a journal file of a layout that we do not know, and
-// reads that. journalctl runs as a child with limits on its time and memory, so a damaged file can
-// kill the child but not us. We do not read all files like this: it costs some sixty times as much
-// as our reader, because it prints every field.
+// ForeignJournalStream reads a journal file of a layout that we do not know: journalctl prints the
+// file, and we read what it prints. journalctl runs as a child with limits on its time and memory,
+// so a damaged file can kill the child but not us. We do not read all files like this: it costs
+// some sixty times as much as our reader, because journalctl prints every field.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -32,22 +32,24 @@ namespace tessel {
 // What all export streams of a store share, so that memory does not grow with their number.
 struct ExportReadResources {
   WindowBudget& windows;
-  size_t bytesKept = 0;              // what all streams keep beyond kUsualEntry each
+  size_t bytesKept = 0;              // by all streams, without kUsualEntry of each
   std::string longHead{};            // the beginning of a line that is read in pieces
   std::vector<FieldToken> tokens{};  // of the current entry
 };
 
 class ExportEntryStream final : public EntryStream {
  public:
-  // Bytes. The journal's own tools refuse longer values, so a greater length is damage. We would
-  // have to read over it before we know.
+  // Bytes. The journal's own tools refuse longer values, so a greater length is damage. Without
+  // this bound we would first read over as many bytes and only then see it.
   static constexpr uint64_t kMaxValueLength = 768ull * 1024 * 1024;
-  // What is kept of one entry at most: fields and bytes that the tokenizer wants.
+  // The most fields that the tokenizer wants, and the most bytes of them, that we keep of one
+  // entry.
   static constexpr size_t kMaxFieldsKept = 1024;
   static constexpr size_t kMaxBytesKept = size_t{1024} * 1024;
-  // Bytes, bookkeeping included. A merge holds one entry of each stream. Every stream may keep
-  // kUsualEntry, or entries would be refused only because there are thousands of files; beyond that
-  // all of them share kMaxBytesKeptByAll.
+  // Bytes, bookkeeping included. A merge holds one entry of each stream, and a store can have
+  // thousands of streams. Each of them may always keep kUsualEntry, so a usual entry is never
+  // refused. The bytes that larger entries need beyond it may not exceed kMaxBytesKeptByAll for all
+  // streams together.
   static constexpr size_t kUsualEntry = 1024;
   static constexpr size_t kMaxBytesKeptByAll = 4 * kMaxBytesKept;
 
@@ -70,8 +72,8 @@ class ExportEntryStream final : public EntryStream {
   struct KeptField {
     uint32_t offset;
     uint32_t nameLength;
-    uint32_t length;  // of what is kept: name, '=' and the head of the value
-    uint32_t size;    // of the whole value; UINT32_MAX: that or more
+    uint32_t length;  // of the kept part: name, '=' and the head of the value
+    uint32_t size;    // of the whole value; UINT32_MAX: at least that
   };
 
   void startEntry();
@@ -109,8 +111,8 @@ class ExportEntryStream final : public EntryStream {
 // A journal file of a layout that we do not know, read by journalctl.
 class ForeignJournalStream final : public EntryStream {
  public:
-  // Starts journalctl on the file at `path`, which should hold `entryCount` entries. Null if it
-  // cannot be started. Adds problems to `report`.
+  // Starts journalctl on the file at `path`, which should hold `entryCount` entries. Returns null
+  // if journalctl cannot be started. The stream adds problems to `report`.
   static std::unique_ptr<ForeignJournalStream> start(const std::string& path, uint64_t entryCount,
                                                      ExportReadResources& resources,
                                                      FieldTokenizer& tokenizer,

@@ -16,8 +16,8 @@
 namespace tessel {
 
 namespace {
-// Of many files only the first entry is looked at before the merge gets to them. One page is enough
-// for that.
+// The merge holds the first entry of every file long before it reads on in most of them. One page
+// is enough for that entry.
 constexpr size_t kFirstWindow = size_t{4} << 10;
 constexpr uint64_t kPage = 4096;
 // A stop must take effect within a few tens of milliseconds, and waking fifty times a second costs
@@ -35,7 +35,8 @@ WindowedFile::~WindowedFile() { budget_.leave(); }
 const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
   if (const uint8_t* bytes = inWindow(offset, size)) return bytes;
   if (offset > size_ || size > size_ - offset) return nullptr;
-  // More than the share only for an object that is larger; this bounds the memory of a run.
+  // The share bounds the memory of a run. moveWindow() below takes more only if the caller asked
+  // for more bytes at once.
   const size_t capacity = std::min(std::max(windowCapacity_ * 2, kFirstWindow), budget_.share());
   const uint64_t end = offset + size;
   uint64_t start = std::min(from, offset);
@@ -43,15 +44,15 @@ const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
   // otherwise a large distance from `from` would leave no room, and each entry would move it.
   if (end - start > capacity / 2)
     start = std::max(start, offset - std::min<uint64_t>(offset, capacity / 2));
-  // A large window begins at a page, because the kernel copies whole pages faster. In a small one
-  // that would waste up to a page; objects begin at multiples of eight.
+  // A large window begins at a page, because the kernel copies whole pages faster. A small one
+  // would waste too much of itself, so it begins at a multiple of eight, as objects do.
   start -= start % (capacity >= 8 * kPage ? kPage : 8);
   moveWindow(start, std::max(static_cast<size_t>(end - start), capacity));
   return inWindow(offset, size);
 }
 
-// A window of another size is allocated anew: its bytes are read again anyway, from a cache of the
-// kernel, and keeping the old ones would need both at once.
+// If the size changes, we free the old window and read all bytes anew. To keep the old bytes we
+// would need both windows at once; the kernel still has them in its cache.
 void WindowedFile::moveWindow(uint64_t start, size_t wanted) {
   if (wanted != windowCapacity_) {
     window_.reset();  // before the new one is taken, so that there are never two
@@ -124,8 +125,8 @@ bool ByteWindow::fill(size_t count) {
   return true;
 }
 
-// Moves the bytes that are held to the front of a buffer for `count` bytes. A buffer that is larger
-// than the share, because of one long value, shrinks here again.
+// Makes room for `count` bytes, and moves the bytes that are held to the front. A long value may
+// have made the buffer larger than the share; here it shrinks again.
 void ByteWindow::makeRoom(size_t count) {
   const size_t wanted = std::max(count, budget_.share());
   if (begin_ + count <= capacity_ && capacity_ <= wanted) return;

@@ -1,9 +1,9 @@
 // Windows: the small pieces of files that are in memory while we read them.
 //
 // WindowedFile reads a regular file at any offset; ByteWindow reads a file, pipe or socket forward.
-// Both copy with read and pread. A memory map would spare the copy, but the kernel kills a process
-// that touches a mapped page of a file that was cut meanwhile, and journals are cut while they are
-// read. Here such a file costs a failed read.
+// Both copy with read and pread. A memory map would spare the copy. But journals are cut while we
+// read them, and the kernel kills a process that touches a mapped page behind the cut. With pread
+// such a file costs a failed read.
 //
 // A store can have thousands of files and reads all of them at once, because it merges them. So all
 // windows share one WindowBudget, and memory does not grow with the number of files.
@@ -29,14 +29,14 @@ namespace tessel {
 // Divides a fixed amount of memory among the files that are read at once.
 class WindowBudget {
  public:
-  // The day of a usual machine has less than 96 files, and 12 MiB give each of them the largest
-  // window. 8,192 files, the most that a store takes, get 1.5 KiB each. All this stays small beside
-  // the 128 MB that a run of the service may take.
+  // On a usual machine a day has fewer than 96 files, and 12 MiB give each of them the largest
+  // window. 8,192 files, the most that a store takes, get 1.5 KiB each. 12 MiB are a tenth of the
+  // 128 MB that a run of the service may take.
   static constexpr size_t kTotal = size_t{12} << 20;
   // An entry and its usual data fit in this.
   static constexpr size_t kSmallest = size_t{1} << 10;
-  // One system call for so many bytes no longer shows in the time of a run, and the window still
-  // fits the processor's second-level cache beside the table of tokens.
+  // With so many bytes for each system call, the calls no longer show in the time of a run. The
+  // window still fits the processor's second-level cache beside the token cache.
   static constexpr size_t kLargest = size_t{128} << 10;
 
   void join() { ++readers_; }
@@ -70,8 +70,9 @@ class WindowedFile {
   bool failed() const { return failed_; }
 
   // Returns the `size` bytes at `offset`, or null if the file does not hold them. If they are not
-  // in the window, it moves, and then it begins at `from` if both fit: a caller that will look at
-  // bytes before `offset` names them here. Valid until the next call of at().
+  // in the window, the window moves. A caller that will also look at bytes before them passes the
+  // offset of these as `from`: the window then begins there if all fit. Valid until the next call
+  // of at().
   const uint8_t* at(uint64_t offset, size_t size, uint64_t from);
   const uint8_t* at(uint64_t offset, size_t size) { return at(offset, size, offset); }
   // Returns the same without moving the window, or null if the bytes are not in it.
@@ -101,8 +102,9 @@ class WindowedFile {
   size_t windowLength_ = 0;
 };
 
-// A file, pipe or socket that is read forward. At the end it reads what was added since. The window
-// has its share of the budget; it is larger only while fill() is asked for more at once.
+// A file, pipe or socket that is read forward. At the end of a file, a further call reads the bytes
+// that were added since. The window has its share of the budget; it is larger only while a call of
+// fill() needs more.
 class ByteWindow {
  public:
   // Owns the descriptor. A wait for a pipe ends at most 20 ms after `stop` is set. `budget` and
@@ -118,12 +120,14 @@ class ByteWindow {
   std::string_view bytes() const { return {buffer_.get() + begin_, end_ - begin_}; }
   // REQUIRES: count <= bytes().size().
   void consume(size_t count);
-  // Passes over `count` bytes; false if there are fewer, and then the place is at the end.
+  // Passes over `count` bytes. False if there are fewer, and then the place is at the end; or after
+  // a stop.
   bool skip(uint64_t count);
-  // Goes back to an earlier place; false if that left the window and the descriptor cannot seek.
+  // Goes back to an earlier place. False if the window no longer holds that place and the
+  // descriptor cannot seek.
   bool rewind(uint64_t place);
 
-  // How many bytes stand before the window, counted from where reading began.
+  // The place of the first of bytes(): how many bytes were consumed since reading began.
   uint64_t place() const { return place_; }
   // The last error of reading, in words; empty if there was none.
   const std::string& error() const { return error_; }

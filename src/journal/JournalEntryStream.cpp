@@ -43,8 +43,8 @@ bool JournalEntryStream::next() {
   return false;
 }
 
-// The offset of the next entry by the chain. If the chain has a gap before it, the search in the
-// gap comes first.
+// The offset of the next entry that the chain lists. If the chain has a gap before that entry, the
+// stream searches the gap first.
 uint64_t JournalEntryStream::nextListed() {
   if (finished_) return 0;
   const uint64_t offset = chain_.next();
@@ -55,8 +55,8 @@ uint64_t JournalEntryStream::nextListed() {
   return nextFound();
 }
 
-// The offset of the next entry while a gap is searched: what the search finds, then the listed
-// entry behind the gap, then the chain.
+// The offset of the next entry while the stream searches a gap. First come the entries that the
+// search finds, then the listed entry behind the gap, then the further entries of the chain.
 uint64_t JournalEntryStream::nextFound() {
   if (search_) {
     if (const auto found = search_->next()) return *found;
@@ -66,9 +66,9 @@ uint64_t JournalEntryStream::nextFound() {
   return nextListed();
 }
 
-// Makes the entry at `offset` the current one. False if there is no valid entry: if its offset or
-// its size is wrong, other entries may stand there, so the part up to the next listed one is
-// searched.
+// Makes the entry at `offset` the current one; false if no valid entry is there. Then its offset or
+// its size may be wrong, and other entries may stand in its place. So the stream searches up to the
+// next listed entry.
 bool JournalEntryStream::take(uint64_t offset) {
   const uint64_t size = file_.readEntry(offset, searchedTo_, entry_);
   if (size == 0) {
@@ -84,8 +84,8 @@ bool JournalEntryStream::take(uint64_t offset) {
   firstFresh_ = searchedTo_;
   searchedTo_ = alignUp(offset + size);
   ++delivered_;
-  // Lists were read when the file was opened. An entry beyond the count was added since and may be
-  // in none of them.
+  // We read the lists when we opened the file. An entry beyond the count was added later, so it may
+  // have a mark and still be in no list.
   entryMarked_ = marked_ == nullptr || delivered_ > file_.header().entryCount || isMarked(offset);
   return true;
 }
@@ -93,16 +93,17 @@ bool JournalEntryStream::take(uint64_t offset) {
 bool JournalEntryStream::isMarked(uint64_t offset) {
   if (!marked_->has(offset)) [[likely]]
     return false;
-  // Without the lists every further entry is looked into, so damage costs time and not entries.
+  // Without the lists we look into every further entry, so damage costs time, not entries.
   if (marked_->missed()) context_.report.addProblem("list of entries damaged", offset);
   if (!marked_->usable()) marked_.reset();
   return true;
 }
 
-// Starts to search what lies before `listed`, the next entry of the chain; 0: up to the end.
+// Starts to search the part before `listed`, the next entry of the chain; 0: up to the end.
 void JournalEntryStream::searchUpTo(uint64_t listed) {
   if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
-  // Entries that are found may be in no list, and the caller would not ask about them in order.
+  // The search may find entries that are in no list, and may pass over listed ones, which would
+  // look as if the lists were wrong. So we look into every entry from here on.
   marked_.reset();
   pending_ = listed;
   const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
@@ -116,10 +117,11 @@ void JournalEntryStream::endSearch() {
   searchedTo_ = std::max(searchedTo_, pending_);
 }
 
-// Says once what the file should have had. A file may be asked again after its end.
+// Reports once what the file should have held. next() may be called again after the end.
 void JournalEntryStream::finish() {
   if (std::exchange(reported_, true)) return;
   const uint64_t expected = file_.header().entryCount;
+  // We asked about no entry beyond the count, so then a list may rightly wait for one.
   if (marked_ && marked_->awaitsMore() && delivered_ <= expected)
     context_.report.addProblem("list of entries damaged", file_.objectsEnd());
   // When the daemon closes a file it cuts off the end that it has not used. Nothing is lost then,
@@ -142,8 +144,8 @@ size_t JournalEntryStream::collectTokens() {
   const size_t count = std::min(all, JournalFile::kMaxItems);
   if (all > count) context_.report.addProblem("entry with too many fields", entryOffset_);
   const uint64_t offset = entryOffset_ + kEntryItemsAt;
-  // From firstFresh_ on, so that the window holds the data objects that were written for this
-  // entry.
+  // If the window moves, it begins at firstFresh_, so that it also holds the data objects that were
+  // written for this entry.
   const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), firstFresh_);
   if (items == nullptr) {
     context_.report.addProblem("entry damaged", entryOffset_);
@@ -153,9 +155,9 @@ size_t JournalEntryStream::collectTokens() {
                                   : tokensOf<uint64_t>(items, count);
 }
 
-// The innermost loop of the service: some 20 fields for each entry. A template for both layouts
-// keeps their difference out of it, and a kept token is written before it is known to be wanted,
-// which spares a branch that the processor cannot predict.
+// This is the innermost loop of the service, with some 20 rounds for each entry. It is a template,
+// so that it need not ask for the layout in each round. It writes each token and then moves on only
+// if the token is wanted: that spares a branch which the processor cannot predict.
 template <typename Item>
 size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
@@ -167,7 +169,8 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
     const uint64_t offset = load<Item>(items + i * step);
     FieldToken token = offset <= TokenCache::kMaxOffset ? cache.find(offset) : TokenCache::kUnknown;
     if (token == TokenCache::kUnknown) [[unlikely]] {
-      // Here and not for each field: only a miss reads and decompresses, which can take long.
+      // We look at the flag here and not for each field: only a miss reads and decompresses, which
+      // can take long.
       if (context_.stop.load(std::memory_order_relaxed)) break;
       token = newTokenAt(offset);
     }
@@ -177,10 +180,11 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   return static_cast<size_t>(kept - tokens);
 }
 
-// Reads a data object and shows it to the tokenizer. Not every token is remembered. An invalid
-// object is not: it may overlap a valid one and would have its key. Nor is a value that was written
-// for this entry and claims no other: nobody asks again, and it would push out a value that recurs.
-// A compressed one is remembered even so, in case the claim is wrong, because it is expensive.
+// Reads a data object and shows it to the tokenizer. The cache does not remember every token. It
+// must not remember an invalid object, because that may overlap a valid one and have the same key.
+// It need not remember a value that was written for this entry and says that no other has it:
+// nobody will ask for it again, and it would push out a value that recurs. It does remember every
+// compressed value: if the value's claim is wrong, decompressing it again and again would be slow.
 FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
   DataObject data;
   if (!file_.readData(offset, context_.resources.data, data)) {
@@ -206,8 +210,8 @@ FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head, uint64_t
                                      size - nameLength - 1);
 }
 
-// Decompresses the name first, and the value only if the name is wanted: most compressed values are
-// long messages, which nobody here wants.
+// Decompresses the name first, and the value only if the name is wanted. Most compressed values are
+// long messages, which no tokenizer of the service wants.
 FieldToken JournalEntryStream::decompressToken(const DataObject& data) {
   const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> target) {
     const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);

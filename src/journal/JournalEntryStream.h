@@ -1,12 +1,13 @@
 // JournalEntryStream: the entries of one journal file, in the file's own order.
 //
-// The chain of entry arrays leads from entry to entry while the window moves forward over the file.
-// A writer puts a new data object directly before the first entry that refers to it, so the window
-// usually holds both. Older data objects were looked at before, and the token cache remembers them.
+// The stream follows the chain of entry arrays from entry to entry, and its window moves forward
+// over the file. A writer puts a new data object directly before the first entry that refers to it,
+// so the window usually holds both. The stream has read older data objects before, and the token
+// cache remembers most of them.
 //
-// If the chain or an entry is damaged, the part up to the next listed entry is searched object by
-// object. The offsets of delivered entries only grow, so none is delivered twice, even if it is
-// both found and listed.
+// If the chain or an entry is damaged, the stream searches the part up to the next listed entry
+// object by object. The offsets of delivered entries only grow, so no entry is delivered twice,
+// even if the search finds it and the chain lists it too.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -77,18 +78,18 @@ class JournalEntryStream final : public EntryStream {
   const uint32_t number_;
   Context context_;
   EntryChain chain_;
-  std::unique_ptr<MarkedEntries> marked_;  // null: every entry may carry a mark
+  std::unique_ptr<MarkedEntries> marked_;  // null: we look into every entry
   std::optional<EntrySearch> search_;
-  uint64_t pending_ = 0;   // the listed entry behind the part that is searched; 0: none
+  uint64_t pending_ = 0;   // the listed entry that follows the searched part; 0: none
   bool finished_ = false;  // the chain has ended
   bool reported_ = false;  // finish() was done
   uint64_t delivered_ = 0;
   uint64_t searchedTo_ = 0;  // entries before this offset were delivered or are lost
-  uint64_t firstFresh_ = 0;  // data from here on was written for the current entry
+  uint64_t firstFresh_ = 0;  // data objects from here on were written for the current entry
   EntryHeader entry_;
   uint64_t entryOffset_ = 0;
   uint64_t entrySize_ = 0;
-  bool entryMarked_ = true;
+  bool entryMarked_ = true;  // false: entry() leaves out the tokens
 };
 
 }  // namespace tessel

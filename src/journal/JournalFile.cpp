@@ -18,7 +18,8 @@ using namespace journal_format;
 
 namespace {
 
-// The size of an object that holds something: an empty data object or entry is damage.
+// The smallest size of a valid object. A writer makes no object that holds nothing, so an empty one
+// is damage.
 uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
   switch (type) {
     case kData:
@@ -42,9 +43,9 @@ Id128 loadId(const uint8_t* at) {
   return id;
 }
 
-// Where the objects end: at the end of the arena, or at the end of the file if the arena still
-// grows or claims more than there is. If the size of the header itself is damaged, we assume the
-// shortest header: the search then finds the first object behind it.
+// Where the objects end. Usually that is the end of the arena; but if the arena still grows, or
+// says that it is larger than the file, it is the end of the file. If the size of the header itself
+// is damaged, we assume the shortest header, and the search finds the first object behind it.
 uint64_t endOfObjects(JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
   if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
       header.headerSize > std::min(fileSize, kMaxHeaderSize)) {
@@ -69,17 +70,19 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   header.sequenceId = loadId(at + kSequenceIdAt);
   header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
   header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
-  // While a file is written, an object behind the last one may be half finished.
+  // A closed file has no unfinished objects. If the offset is damaged, we do not use it: otherwise
+  // it would hide intact objects.
   const auto lastObject = load<uint64_t>(at + kTailObjectAt);
   const bool growing = header.beingWritten() && aligned(lastObject) &&
                        lastObject >= header.headerSize && lastObject < header.objectsEnd;
   header.lastObject = growing ? lastObject : UINT64_MAX;
-  // The count decides how many entries are reported missing, so a wild one must not get through.
+  // We report as missing the entries that are counted but not found. So a damaged count must not be
+  // greater than the file's room for entries.
   header.entryCount = std::min(load<uint64_t>(at + kEntryCountAt), fileSize / kEntryItemsAt);
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
   header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
-  // Old headers lack these. Without them the index is not used.
+  // Old headers lack these values. They then stay 0, and the index is not used.
   if (bytes.size() >= kHeaderRead && header.headerSize >= kHeaderRead) {
     header.fieldTable = load<uint64_t>(at + kFieldTableAt);
     header.fieldTableSize = load<uint64_t>(at + kFieldTableSizeAt);
@@ -88,7 +91,7 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   return header;
 }
 
-// The daemon may append between the two calls. The size is asked for last, so that it covers
+// The daemon may append between the two calls. We ask for the size last, so that it covers
 // everything that the header counts.
 std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
   std::array<uint8_t, kHeaderRead> bytes;
@@ -102,7 +105,7 @@ std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
   return JournalBeginning{std::get<JournalHeader>(parsed), fileSize};
 }
 
-// The size of an item and of the data header are computed once: both are asked for every entry.
+// Both sizes are needed for every entry, so we compute them once.
 JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header,
                          WindowBudget& budget)
     : header_(header),
@@ -139,8 +142,8 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
   entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
   entry.bootId = loadId(at + kEntryBootAt);
   entry.contentHash = load<uint64_t>(at + kEntryHashAt);
-  // The merge and the range trust these numbers, so one beyond what a daemon writes condemns the
-  // entry.
+  // The merge and the range trust these numbers. So an entry is invalid if one of them is greater
+  // than any that a daemon writes.
   if (entry.sequenceNumber == 0 || entry.sequenceNumber > kMaxSequenceNumber ||
       entry.realtime == 0 || entry.realtime >= kMaxTime || entry.monotonic >= kMaxTime)
     return 0;

@@ -1,11 +1,13 @@
 // JournalFile: one journal file with its header and its objects.
 //
-// Nothing in a file is believed. Any user can write entries, disks fail, and a daemon that is
-// killed leaves half an object. So before a value is used, it is checked: an offset against the
-// file's real size and the alignment, a size against the bytes that are left, a type, the reserved
-// bits, a time and a number against what a writer can produce. What fails a check is treated as if
-// it were not there, and the caller decides what that costs. Hashes are not checked: that would
-// read every payload again, and damage that keeps all links and sizes right only changes a text.
+// We trust nothing in a file. Any user can write entries, disks fail, and a daemon that is killed
+// leaves half an object. So we check each value before we use it: an offset against the file's real
+// size and the alignment; a size against the bytes that are left; types, reserved bits, times and
+// numbers against those that a writer can produce. An object that fails a check counts as absent,
+// and the caller decides what follows.
+//
+// We do not check hashes: for that we would have to read every payload whole. Damage that keeps all
+// links and sizes right can therefore change a text.
 //
 // Threads: one at a time.
 
@@ -24,17 +26,19 @@
 
 namespace tessel {
 
-// What the reader uses of a file's header. A file that is being written has moved on since.
+// The values of a file's header that we use, as they were when we opened the file. If the file is
+// being written, the header has changed since.
 struct JournalHeader {
   uint32_t incompatibleFlags = 0;
   uint8_t state = 0;
   Id128 sequenceId{};
   uint64_t headerSize = 0;  // bytes; the objects begin there
   uint64_t objectsEnd = 0;  // the objects end there, at most at the end of the file
-  // How many entries the header claims, but not more than the file has room for.
+  // How many entries the header counts; at most as many as the file has room for.
   uint64_t entryCount = 0;
   uint64_t entryArray = 0;  // offset of the first entry array; 0: none
-  // Objects behind this offset may be unfinished. UINT64_MAX: the file is closed, all are finished.
+  // Objects behind this offset may be unfinished. UINT64_MAX: the file is closed and all are
+  // finished, or the header's offset is damaged.
   uint64_t lastObject = 0;
   uint64_t headRealtime = 0;  // of the first and last entry written; 0: unknown
   uint64_t tailRealtime = 0;
@@ -49,7 +53,8 @@ struct JournalHeader {
   bool beingWritten() const { return state == journal_format::kOnline; }
 };
 
-// Parses the beginning of a file of `fileSize` bytes; the reason if it is no journal.
+// Parses the beginning of a file of `fileSize` bytes. If the file is no journal, returns the
+// reason.
 std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint8_t> bytes,
                                                             uint64_t fileSize);
 
@@ -69,7 +74,7 @@ struct ObjectHeader {
 
 struct DataObject {
   uint8_t compression = 0;  // a journal_format::DataFlag; 0: none
-  uint64_t entryCount = 0;  // how many entries it claims to be in
+  uint64_t entryCount = 0;  // how many entries it says refer to it
   uint64_t payloadOffset = 0;
   uint64_t payloadSize = 0;       // in the file, at least 1
   std::span<const uint8_t> head;  // the beginning of the payload, in the window or in `scratch`
@@ -77,8 +82,8 @@ struct DataObject {
 
 class JournalFile {
  public:
-  // The journal daemon takes 1,024 fields in an entry and adds some of its own. Of an entry with
-  // more than twice as many we read the first ones, and say so.
+  // The journal daemon accepts 1,024 fields in an entry and adds some of its own, so twice as many
+  // are enough. If an entry has more, the stream reads the first 2,048 and reports the entry.
   static constexpr size_t kMaxItems = 2048;
 
   JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header, WindowBudget& budget);
@@ -86,7 +91,7 @@ class JournalFile {
   const JournalHeader& header() const { return header_; }
   WindowedFile& file() { return file_; }
 
-  // The end of the objects; moves to the front if a read finds the file shorter.
+  // The end of the objects. It becomes smaller if a read finds the file shorter.
   uint64_t objectsEnd() const { return std::min(header_.objectsEnd, file_.size()); }
   // Whether an object of `least` bytes may begin at `offset`.
   bool mayHoldObject(uint64_t offset, uint64_t least) const {
@@ -97,9 +102,9 @@ class JournalFile {
   // or if it is longer than `room` bytes. REQUIRES: bytes.size() >= kObjectHeaderSize.
   std::optional<ObjectHeader> objectHeader(std::span<const uint8_t> bytes, uint64_t room) const;
 
-  // Fills `entry` from the entry object at `offset`, but not its sequence id, which is the file's.
-  // The window may move, and then it begins at `from` if possible. Returns the size of the object
-  // in bytes; 0 if there is no valid entry.
+  // Fills `entry` from the entry object at `offset`, except for its sequence id, which is that of
+  // the file. If the window moves, it begins at `from` if possible. Returns the size of the object
+  // in bytes; 0 if there is no valid entry, and then `entry` may hold values of an invalid one.
   uint64_t readEntry(uint64_t offset, uint64_t from, EntryHeader& entry);
   // How many data objects an entry object of `size` bytes refers to.
   size_t itemCount(uint64_t size) const {

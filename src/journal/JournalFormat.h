@@ -34,18 +34,18 @@ namespace tessel::journal_format {
 
 inline constexpr char kSignature[9] = "LPKSHHRH";
 
-// The shortest header that was ever written. Newer writers append to it, which we may ignore.
+// The shortest header that was ever written. Newer writers append values, which we may ignore.
 inline constexpr uint64_t kMinHeaderSize = 208;
 // We read a longer header up to here: kFieldCountAt is the last value that we use.
 inline constexpr uint64_t kHeaderRead = 224;
 // Writers use less than 300 bytes. A header that claims more than a page is damaged.
 inline constexpr uint64_t kMaxHeaderSize = 4096;
 
-// A file with a flag that we do not know cannot be read by us.
+// If a file has a flag that we do not know, we cannot read it.
 enum IncompatibleFlag : uint32_t {
   kCompressedXz = 1,
   kCompressedLz4 = 2,
-  kKeyedHash = 4,  // concerns the hash tables' order, which we do not depend on
+  kKeyedHash = 4,  // changes the order of the hash tables; we do not rely on it
   kCompressedZstd = 8,
   kCompact = 16,
 };
@@ -78,7 +78,7 @@ enum ObjectType : uint8_t {
   kDataHashTable = 4,
   kFieldHashTable = 5,
   kEntryArray = 6,
-  kTag = 7,  // seals what stands before it; we do not check seals
+  kTag = 7,  // a seal of the objects before it; we do not check seals
 };
 
 // How a payload is compressed. A data object has at most one of these flags.
@@ -89,7 +89,7 @@ inline constexpr uint8_t kKnownDataFlags = kXz | kLz4 | kZstd;
 inline constexpr size_t kObjectHeaderSize = 16;
 inline constexpr size_t kObjectSizeAt = 8;
 
-inline constexpr size_t kBucketSize = 16;  // the first and the last object of the bucket
+inline constexpr size_t kBucketSize = 16;  // the offsets of the bucket's first and last object
 inline constexpr size_t kNextInBucketAt = 24;
 
 inline constexpr size_t kNextValueAt = 32;

@@ -22,7 +22,7 @@ namespace {
 class SequenceWatch {
  public:
   void see(const EntryHeader& entry) {
-    // Entries of one sequence come in long rows, so the last one is tried before all are searched.
+    // Entries of one sequence come in long rows, so we try the last sequence before we search all.
     if (last_ < seen_.size() && sameId(seen_[last_].id, entry.sequenceId)) {
       advance(seen_[last_], entry.sequenceNumber);
     } else {
@@ -33,8 +33,9 @@ class SequenceWatch {
   uint64_t missing() const { return missing_; }
 
  private:
-  // A machine has a few sequences, one for each daemon that ever ran with new files. They are
-  // looked up one by one, so a store that was made to have thousands is followed only in part.
+  // A machine has few sequences: a daemon begins one only if it finds no earlier file to continue.
+  // We look through them one by one, so a store that was made to have thousands would cost time.
+  // Sequences beyond this bound are not watched.
   static constexpr size_t kMaxSequences = 1024;
 
   struct Sequence {
@@ -43,7 +44,8 @@ class SequenceWatch {
   };
 
   void advance(Sequence& sequence, uint64_t number) {
-    // A lower number comes only from damage or copies. Going back would count the gap again.
+    // A lower number comes only from damage or copies. If we went back to it, we would count the
+    // same gap again.
     if (number <= sequence.number) return;
     const uint64_t leftOut = number - sequence.number - 1;
     gaps_ += leftOut != 0;
@@ -59,7 +61,8 @@ class SequenceWatch {
 };
 
 void SequenceWatch::change(const EntryHeader& entry) {
-  // Numbers of no known sequence may come from many, so a gap between them means nothing.
+  // Entries without a sequence id may come from many sequences, so a gap between their numbers
+  // means nothing.
   if (entry.sequenceId == Id128{}) return;
   const auto known = std::find_if(seen_.begin(), seen_.end(), [&](const Sequence& sequence) {
     return sequence.id == entry.sequenceId;
@@ -73,12 +76,13 @@ void SequenceWatch::change(const EntryHeader& entry) {
   }
 }
 
+// Two files with equal keys would return each other's tokens.
 static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
 
-// The sequence of a stream whose entries may count in any.
+// For a stream whose entries may belong to any sequence.
 constexpr Id128 kNoSequence{};
 
-// Adds what one file yielded to what the store did.
+// Adds the result of reading one file to that of the store.
 void addFile(const FileReport& file, StoreReading& reading) {
   if (!file.skipped) {
     ++reading.filesRead;
@@ -122,7 +126,7 @@ struct JournalStore::State final : EntryStream {
   ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
   const std::vector<EntryMark> marks = tokenizer.marks();
-  StoreReport facts;  // streams refer to its files, so their number is set before the first stream
+  StoreReport facts;  // streams keep references to its files: see openFiles()
   size_t usableFiles = 0;
   ErrorCode firstFailure = ErrorCode::notAStore;  // why the first file is not usable
   size_t foreignFiles = 0;                        // that journalctl reads for us
@@ -133,7 +137,8 @@ struct JournalStore::State final : EntryStream {
 bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
-    // Entries outside the range count for gaps and age: they show how far back the store reaches.
+    // Entries outside the range count too: they show how far back the store reaches, and without
+    // them their numbers would look like gaps.
     sequences.see(entry);
     seeTime(entry.realtime);
     if (entry.realtime < range.start || entry.realtime >= range.end) continue;
@@ -145,12 +150,14 @@ bool JournalStore::State::next() {
 }
 
 Entry JournalStore::State::entry() {
-  // The daemon's own words about losses are taken out here, so that users see only what they want.
+  // The fields of the daemon's loss messages end here, so that the user sees only tokens of its
+  // own.
   const Entry whole = merger.entry();
   return {whole.header, tokenizer.takeOwn(whole.tokens)};
 }
 
-// The report's list of files is made before the first stream: streams keep references into it.
+// Streams keep references to elements of facts.files, so it gets its final length before the first
+// stream.
 void JournalStore::State::openFiles(StoreFiles found) {
   facts.reading.losses.add(LossCode::filesNotLookedAt, "too many files to look at", {},
                            found.leftOut);
@@ -188,13 +195,13 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
     return;
   }
   const auto& [header, size] = std::get<JournalBeginning>(opened);
-  // A flag that we do not know may change any layout, so nothing behind the header can be trusted.
+  // A flag that we do not know may change the layout of anything behind the header.
   if (header.unknownFlags() != 0) {
     openForeign(file, header.entryCount, number);
     return;
   }
   ++usableFiles;
-  // The age of the store is known without reading the files that the range leaves out.
+  // The header tells the age of a file even if we need not read the file.
   if (header.headRealtime != 0) seeTime(header.headRealtime);
   if (outsideRange(header)) {
     report.skipped = "outside the range";
@@ -207,7 +214,8 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
              number, header.sequenceId);
 }
 
-// A file that only a newer reader understands. The machine's own journalctl is likely to be one.
+// Only a newer reader understands such a file. The machine's own journalctl is likely to be new
+// enough.
 void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint32_t number) {
   FileReport& report = facts.files[number];
   if (foreignFiles == kMaxForeignFiles) {
@@ -226,10 +234,11 @@ void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint
   merger.add(std::move(stream), number, kNoSequence);
 }
 
-// Skipping a file by the times of its first and last entry spares most of the work of a run over a
-// long journal. If the clock was set back within the file, the two are usually the wrong way round,
-// and then it is read. If the clock was also set forward again, they are not, and the few entries
-// between the two changes are lost. Looking at each entry would be the price of finding them.
+// The header has the times of the first and last entry written. To skip a file by these two spares
+// most of the work of a run over a long journal. The price: if the clock was set while the file was
+// written, entries between may be earlier or later than both. If the last entry is earlier than the
+// first, we see that the clock was set, and read the file. Otherwise such entries are lost; to find
+// them we would have to look at every entry.
 bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   if (header.beingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
@@ -237,8 +246,8 @@ bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   return header.tailRealtime < range.start || header.headRealtime >= range.end;
 }
 
-// Why the store as a whole cannot be used; nothing if it can. One file that can be read is enough:
-// what was wrong with the others is in the report.
+// Why the store as a whole cannot be used; nothing if it can. One file that can be read is enough;
+// the report tells what was wrong with the others.
 std::optional<PlatformError> JournalStore::State::failure(const std::string& place) const {
   // After a stop the files were not all opened, and an empty store would be a wrong reason.
   if (usableFiles != 0 || stop.load(std::memory_order_relaxed)) return std::nullopt;
@@ -255,7 +264,6 @@ JournalStore::~JournalStore() = default;
 std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
     const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
     const StopFlag& stop) {
-  // All files are opened before the first is read: the daemon may rotate while we read.
   auto found = openStoreFiles(path, kMaxFiles, stop);
   if (auto* error = std::get_if<PlatformError>(&found)) return std::move(*error);
   const std::string place = path.value_or("the machine's journal");

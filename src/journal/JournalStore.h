@@ -1,8 +1,8 @@
 // JournalStore: the journal and export files of one place, merged, for one time range.
 //
-// A store is a directory that holds `*.journal`, `*.journal~` or `*.export` files at any depth, one
-// such file, or the journal of this machine. All files are opened at the beginning and stay open,
-// so a rotation meanwhile neither hides a file nor shows it twice.
+// A store is a directory that holds `*.journal`, `*.journal~` or `*.export` files, one such file,
+// or the journal of this machine. All files are opened at the beginning, and each stays open until
+// it is read. So a rotation while we read neither hides a file nor shows it twice.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -27,11 +27,12 @@ struct TimeRange {
 
 class JournalStore {
  public:
-  // Each file takes a descriptor, a window and some 2 KiB. 8,192 files are 40 MB, a third of what a
-  // run may take. Further files are only counted in the report. TokenCache has 13 bits for them.
+  // Each file takes a descriptor, a window and some 2 KiB. 8,192 files take some 40 MB, a third of
+  // the memory of a run. The report only counts further files. The keys of TokenCache have 13 bits
+  // for the number of a file, so this is also the most that they can tell apart.
   static constexpr size_t kMaxFiles = 8192;
-  // Files of an unknown layout that are read. Each takes a process with up to 1 GiB of addresses,
-  // and all of them run at the same time because they are merged.
+  // The most files of an unknown layout that are read. Each takes a process with up to 1 GiB of
+  // address space. All these processes run at the same time, because their entries are merged.
   static constexpr size_t kMaxForeignFiles = 16;
 
   // Opens the store at `path`; without a path, the journal of this machine. An error has a code and

@@ -1,4 +1,4 @@
-// Counts and units of lost entries as tokens.
+// Codes the fields of loss messages as tokens, and adds up what these say.
 
 #include "journal/LossTokenizer.h"
 
@@ -12,17 +12,18 @@ namespace {
 constexpr std::string_view kMessageId = "MESSAGE_ID";
 constexpr std::string_view kCount = "N_DROPPED";
 constexpr std::string_view kUnit = "OBJECT_SYSTEMD_UNIT";
+// The id that the daemon gives its message about suppressed entries.
 constexpr std::string_view kLossMessage = "a596d6fe7bfa4994828e72309e95d61e";
 
-// Our tokens: the message, then 2^30 - 1 for counts, then one for each unit. A count is its own
-// token, so that no number of different counts needs memory.
+// Our tokens: one for the message, then 2^30 - 1 for counts, then one for each unit. The token of a
+// count holds the count itself, so different counts take no memory.
 constexpr FieldToken kLossToken = kFirstReservedToken;
 constexpr FieldToken kFirstCount = kFirstReservedToken + 1;
 constexpr FieldToken kFirstUnit = kFirstReservedToken + 0x40000000;
 
 bool isOurs(FieldToken token) { return token >= kFirstReservedToken; }
 
-// A greater count than a token can hold, about a billion, becomes the greatest.
+// A token can hold counts up to about a billion. We take a greater count for the greatest of these.
 FieldToken countToken(std::string_view value) {
   uint64_t number = 0;
   const auto [end, error] = std::from_chars(value.data(), value.data() + value.size(), number);
@@ -33,7 +34,8 @@ FieldToken countToken(std::string_view value) {
 
 }  // namespace
 
-// A user without marks sees every entry, and so do we.
+// A user without marks sees every entry, and one mark of ours would make the readers leave out the
+// rest.
 std::vector<EntryMark> LossTokenizer::marks() const {
   std::vector<EntryMark> marks = user_.marks();
   if (!marks.empty()) marks.push_back({kMessageId, kLossMessage});
@@ -46,7 +48,8 @@ bool LossTokenizer::wants(std::string_view fieldName) const {
 }
 
 FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view value, uint64_t size) {
-  // Anyone can send this message id, so what it says is counted and shown, but decides nothing.
+  // Anyone can send this message id. So we count and show what the message says, but nothing else
+  // depends on it.
   if (field == kMessageId && value == kLossMessage) {
     met_ = true;
     return kLossToken;
@@ -59,7 +62,7 @@ FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view valu
 FieldToken LossTokenizer::unitToken(std::string_view name) {
   if (name.empty() || name.size() > kMaxUnitLength) return kNoToken;
   if (const auto known = unitTokens_.find(name); known != unitTokens_.end()) return known->second;
-  // No token: the entry then counts under the empty name, so the sum stays right.
+  // Without a token the loss counts under the empty name, so the sum stays right.
   if (units_.size() > kMaxUnits) return kNoToken;
   const FieldToken token = kFirstUnit + static_cast<FieldToken>(units_.size());
   units_.push_back({std::string(name), 0});
@@ -68,8 +71,8 @@ FieldToken LossTokenizer::unitToken(std::string_view name) {
 }
 
 std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
-  // Nearly all stores have no such entry, and nearly all entries are none: one pass without a
-  // branch finds out.
+  // Most stores have no loss message, and in the others nearly no entry is one. The greatest token
+  // tells, and the loop that finds it has no branch.
   if (!met_) return tokens;
   FieldToken highest = 0;
   for (const FieldToken token : tokens) highest = std::max(highest, token);
@@ -99,7 +102,7 @@ void LossTokenizer::count(std::span<const FieldToken> tokens) {
 void LossTokenizer::addDropped(Losses& losses) const {
   std::vector<DroppedEntries> units = units_;
   std::erase_if(units, [](const DroppedEntries& one) { return one.count == 0; });
-  // Up to the list's own limit the order of first sight stays, which is that of the journal.
+  // If all units fit in the list, they stay in the order in which the journal first names them.
   if (units.size() > Losses::kMaxOfACode) {
     std::stable_sort(
         units.begin(), units.end(),

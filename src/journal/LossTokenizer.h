@@ -1,8 +1,11 @@
-// LossTokenizer: notices the entries in which the journal daemon says that it dropped others.
+// LossTokenizer: counts the entries that the journal daemon dropped, from the daemon's own messages
+// about them.
 //
-// It stands between the readers and the tokenizer of the store's user. It keeps the fields of such
-// an entry under tokens of its own and takes them away before the user sees the entry. So the store
-// counts what was dropped, and its users need not know how the daemon says it.
+// A service that logs too fast exceeds the daemon's rate limit. The daemon then drops entries and
+// writes one entry that says how many: a loss message. LossTokenizer stands between the readers and
+// the tokenizer of the store's user. It gives the fields of a loss message tokens of its own, and
+// removes these before the user sees the entry. So users of the store need not know how the daemon
+// reports losses.
 //
 // Threads: one at a time.
 
@@ -20,8 +23,9 @@ namespace tessel {
 
 class LossTokenizer final : public FieldTokenizer {
  public:
-  // Anyone may write such entries, so both are bounded. Further units, and longer names (systemd
-  // allows 255 bytes), are counted together under the empty name.
+  // Anyone may write such messages, so the number of units and the length of their names are
+  // bounded. Losses of further units, and of units with longer names (systemd allows 255 bytes),
+  // count together under the empty name.
   static constexpr size_t kMaxUnits = 4096;
   static constexpr size_t kMaxUnitLength = 256;
 
@@ -33,15 +37,17 @@ class LossTokenizer final : public FieldTokenizer {
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return user_.generation(); }
 
-  // The tokens of an entry without our own; valid until the next call. If the entry tells of a
-  // loss, counts it. Call it once for each entry.
+  // Returns the tokens of an entry without our own; valid until the next call. If the entry is a
+  // loss message, counts the loss, so call this once for each entry. Before the first loss message
+  // our own tokens stay in; users ignore tokens from kFirstReservedToken on.
   std::span<const FieldToken> takeOwn(std::span<const FieldToken> tokens);
-  // Adds what was counted. If the list has no room for all units, those that lost most come first.
+  // Adds the losses that were counted. If the list has no room for all units, those with the
+  // greatest losses come first.
   void addDropped(Losses& losses) const;
 
  private:
   struct DroppedEntries {
-    std::string unit;  // empty: the daemon named none, or one too many
+    std::string unit;  // empty: no name, a name that is too long, or units beyond kMaxUnits
     uint64_t count = 0;
   };
 
@@ -49,7 +55,7 @@ class LossTokenizer final : public FieldTokenizer {
   void count(std::span<const FieldToken> own);
 
   FieldTokenizer& user_;
-  bool met_ = false;  // whether the daemon's message was ever shown
+  bool met_ = false;  // whether any loss message was shown yet
   std::map<std::string, FieldToken, std::less<>> unitTokens_;
   std::vector<DroppedEntries> units_ = std::vector<DroppedEntries>(1);  // the first has no name
   std::vector<FieldToken> theirs_;

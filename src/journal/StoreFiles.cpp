@@ -21,10 +21,10 @@ namespace tessel {
 
 namespace {
 
-// Journals lie one directory deep, collected ones a few. Each level holds a descriptor open, and
-// the file system may have a loop of mounts.
+// The files of a machine lie one directory deep, collected ones a few. The bound is needed because
+// each level keeps a descriptor open and mounts may form a loop.
 constexpr int kDeepestDirectory = 32;
-// Two listings are usual. A place where each listing finds a new file is filled on purpose.
+// Two listings are usual. If each listing finds a new file, somebody fills the place on purpose.
 constexpr int kMostListings = 8;
 
 std::optional<StoreFileKind> kindOf(std::string_view name) {
@@ -61,7 +61,8 @@ int Finder::addDirectory(const std::string& directory) {
   const uint64_t leftOutElsewhere = found_.leftOut;
   for (int i = 0; i < kMostListings && before != known_.size() && !stop_.load(); ++i) {
     before = known_.size();
-    // What fails in one listing and not in the next was renamed or removed in between.
+    // Only failures of the last listing count: a file that fails in one listing and not in the next
+    // was renamed or removed in between.
     failed_.erase(failed_.begin() + static_cast<ptrdiff_t>(failedElsewhere), failed_.end());
     found_.leftOut = leftOutElsewhere;
     error = list(directory, 0);
@@ -98,8 +99,9 @@ void Finder::visit(const std::string& path, const dirent& entry, int depth) {
   if (error != 0 && error != ENOENT) fail(path, StoreFileKind::journal, error);
 }
 
-// Opens first and asks what it is afterwards; otherwise it could be exchanged in between. So
-// opening must not wait: a pipe would wait for its other end.
+// Opens the file first and then asks whether it is a regular one; the other way round, somebody
+// could exchange it in between. So it may be a pipe, and O_NONBLOCK keeps open() from waiting for
+// the pipe's other end.
 void Finder::addFile(const std::string& path, StoreFileKind kind) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!fd.valid()) {
@@ -108,8 +110,8 @@ void Finder::addFile(const std::string& path, StoreFileKind kind) {
   }
   struct stat status {};
   if (::fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return;
-  // Two names of one file, by a hard link, a symbolic one or a rename between two listings, would
-  // show all its entries twice.
+  // One file can have two names, by a hard or symbolic link or a rename between two listings. We
+  // take it once; otherwise each of its entries would be read twice.
   const std::pair identity(status.st_dev, status.st_ino);
   if (known_.count(identity) != 0) return;
   if (known_.size() >= limit_) {
@@ -150,8 +152,9 @@ PlatformError storeError(const std::string& path, int error) {
   return {codeOf(error), path + ": " + whyNotOpened(error)};
 }
 
-// The daemon keeps its files under /var if that directory exists, otherwise under /run. After it
-// was created, both hold a part, so both are read; one of them is enough.
+// The daemon keeps its files under /var/log/journal if that directory exists, otherwise under /run.
+// If the directory was made later, each place holds a part of the journal. So we read both, and it
+// is no error if one of them is absent.
 std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
   // Other machines' journals may lie beside ours, in directories named after their ids.
   const std::string machine(trimmed(readSmallFile("/etc/machine-id", 4096).value_or("")));

@@ -1,9 +1,9 @@
 // StoreFiles: finds and opens the files of a journal store.
 //
-// The daemon renames and removes files while we list them. So each file is opened when it is found
-// and known by device and inode, not by name, and the place is listed again until nothing new shows
-// up. A file that is renamed meanwhile is then neither lost nor taken twice. Locking the directory
-// would be simpler, but the daemon takes no such lock.
+// The daemon renames and removes files while we list them. So we open each file as soon as we find
+// it, and recognise it by device and inode, not by name. We list the place again until nothing new
+// shows up. A file that is renamed in between is then neither lost nor taken twice. It would be
+// simpler to lock the directory, but the daemon heeds no such lock.
 //
 // Threads: one at a time, except for the stop flag.
 
@@ -35,12 +35,13 @@ struct StoreFiles {
   uint64_t leftOut = 0;  // files beyond the limit
 };
 
-// Opens the files at `path`, a directory or one file; without a path, those of this machine's
-// journal; at most `limit`. An error if there is no such place or it cannot be read.
+// Opens the files at `path`, which is a directory or one file; without a path, the files of this
+// machine's journal. Opens at most `limit` files. Returns an error if there is no such place or it
+// cannot be read.
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
                                                        size_t limit, const StopFlag& stop);
 
-// The words for the errno `error`; if access was denied, with what to do about it.
+// Describes the errno `error`. If access was denied, the text also says who has access.
 std::string whyNotOpened(int error);
 
 }  // namespace tessel

@@ -17,10 +17,10 @@ namespace tessel {
 struct FileReport {
   std::string path;
   uint64_t entriesRead = 0;            // of those in the range
-  std::optional<std::string> skipped;  // why the file was not read; absent where it was
-  bool outsideRange = false;           // that is why: it has nothing for the range, and all is well
-  bool refused = false;                // that is why: this user may not read it
-  Losses problems;                     // damage; the places are of this file and have no name
+  std::optional<std::string> skipped;  // why the file was not read; absent if it was
+  bool outsideRange = false;           // skipped, without harm: it has no entry of the range
+  bool refused = false;                // skipped: this user may not read it
+  Losses problems;                     // damage; the places are offsets in this file
 
   // `offset` is the byte where the damage was met.
   void addProblem(std::string_view reason, uint64_t offset, uint64_t count = 1) {

@@ -1,17 +1,19 @@
 // TokenCache: remembers which token a data object of a file has, in half a megabyte.
 //
-// Without it each entry would cost a read and a lookup for each of its fields. One cache serves all
-// files of a store, so its size depends neither on their number nor on theirs. It fits the
-// processor's second-level cache; a table of all data objects would not, and could not be bounded.
-// What the cache has forgotten is read and shown to the tokenizer again.
+// Without it each field of each entry would cost a read and a lookup. One cache serves all files of
+// a store, so its size does not depend on the files. It fits the processor's second-level cache; a
+// table of all data objects would not fit and would have no bound. If the cache has forgotten a
+// token, the reader reads the data object and shows it to the tokenizer again.
 //
-// A key is the number of the file and the offset of the object. It selects a set of two slots. A
-// new token goes to the second slot, and moves to the first when it is found there. So values that
-// occur once, most values of a journal, push out one another, but not those that recur.
+// A key is made of the number of the file and the offset of the object. It selects a set of two
+// slots. A new token goes to the second slot; when it is found there, it moves to the first. Most
+// values of a journal occur once. They push out one another in the second slot, but not the values
+// that recur.
 //
-// A slot must never return the token of another object: that would be a wrong value in an event. So
-// a slot holds the part of the key that does not select the set (the tag), and set and tag together
-// are the whole key. Offsets are divided by 64: a data object is larger, so no two have one key.
+// A slot must never return the token of another object: that would put a wrong value into an event.
+// So a slot also holds the tag, the part of the key that does not select the set. Set and tag
+// together are the whole key. The key holds the offset divided by 64. Data objects are longer than
+// 64 bytes and do not overlap, so no two of a file have the same key.
 //
 // Threads: one at a time.
 
@@ -47,15 +49,15 @@ class TokenCache {
  public:
   // Numbers of files are below this.
   static constexpr uint32_t kMaxFiles = uint32_t{1} << kFileBits;
-  // 2^38 bytes, 256 GiB, of a file. An object beyond would have the key of another one, so it is
-  // never remembered; the daemon rotates its files long before.
+  // 256 GiB of a file. An object behind that would have the key of another one, so the cache never
+  // remembers it. The daemon rotates its files long before.
   static constexpr uint64_t kMaxOffset = (uint64_t{1} << (kPlaceBits + kPlaceShift)) - 1;
   // What find() returns if nothing is remembered. No token has this value.
   static constexpr FieldToken kUnknown = UINT32_MAX;
 
   TokenCache() : sets_(std::make_unique_for_overwrite<Set[]>(kSets)) { clear(); }
 
-  // Forgets everything if `generation` is not that of the tokens it remembers.
+  // Forgets all tokens if they are of another generation than `generation`.
   void useGeneration(uint32_t generation) {
     if (generation == generation_) [[likely]]
       return;

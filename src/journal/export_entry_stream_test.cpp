@@ -18,7 +18,8 @@ using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 using Lines = std::vector<std::string>;
 
-// Wants what begins with T and remembers it, its size behind a slash where it is not all there.
+// Wants the fields whose names begin with T, and remembers their texts. If a value was cut, its
+// text is shortened and ends with a slash and the size of the whole value.
 class RecordingTokenizer final : public FieldTokenizer {
  public:
   bool wants(std::string_view name) const override { return name.starts_with('T'); }
@@ -39,7 +40,7 @@ std::string binary(std::string_view name, std::string_view value,
   return field + std::string(value) + "\n";
 }
 
-// Alone, and beside so many other files that the window is as small as it gets.
+// The parameter is the number of other files. With many of them the window is as small as possible.
 class ExportEntryStreamTest : public ::testing::TestWithParam<size_t> {
  protected:
   ExportEntryStreamTest()
@@ -49,12 +50,12 @@ class ExportEntryStreamTest : public ::testing::TestWithParam<size_t> {
   }
   ~ExportEntryStreamTest() override { ::close(file_); }
 
-  // At the end of the file, as another process does that has its own place in it.
+  // Writes at the end of the file without moving the offset from which the stream reads.
   void append(std::string_view text) {
     ASSERT_EQ(::pwrite(file_, text.data(), text.size(), size_), ssize_t(text.size()));
     size_ += static_cast<off_t>(text.size());
   }
-  // The wanted fields of every entry up to the end, one line per entry with its time in front.
+  // Reads to the end. One line for each entry: its time and its wanted fields.
   Lines readAll() {
     Lines lines;
     while (stream_.next()) {
@@ -213,7 +214,7 @@ TEST_P(ExportEntryStreamTest, aStopEndsIt) {
   EXPECT_THAT(problems(), IsEmpty());
 }
 
-// Many streams of one store over a file with an entry of a megabyte and a usual one behind it.
+// Many streams of one store read the same file: an entry of a megabyte, then a usual one.
 class ExportResourcesTest : public ::testing::Test {
  protected:
   ExportResourcesTest() {

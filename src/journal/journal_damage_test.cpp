@@ -1,4 +1,5 @@
-// Damaged journals: what is lost is what was damaged, and nothing is read twice, hangs or crashes.
+// Damaged journals: only damaged entries are lost, no entry is read twice, and the reader neither
+// hangs nor crashes.
 //
 // TESSEL_DAMAGE_ROUNDS=10000 makes the random damage as thorough as it is before a release.
 
@@ -36,7 +37,7 @@ struct Outcome {
   bool refused = false;
 };
 
-// Reads a file to its end; after `pause` entries, `meanwhile` happens.
+// Reads a file to its end, and calls `meanwhile` after `pause` entries.
 Outcome read(const std::string& path, size_t pause = SIZE_MAX,
              const std::function<void()>& meanwhile = {}) {
   testing::RecordingTokenizer tokenizer;
@@ -110,7 +111,8 @@ TEST_P(JournalDamageTest, FindsAllBehindADamagedHeader) {
     for (const size_t at :
          {kHeaderSizeAt, kArenaSizeAt, kTailObjectAt, kEntryCountAt, kEntryArrayAt}) {
       std::string file = writer.bytes();
-      // Nothing lies behind an arena of this size.
+      // The reader believes an arena that is smaller than the file, and looks for no entry behind
+      // it.
       if (at == kArenaSizeAt && wrong < file.size()) continue;
       put(file, at, wrong);
       const Outcome outcome = read(directory_.write("a.journal", file));
@@ -132,7 +134,9 @@ TEST_P(JournalDamageTest, LosesOnlyDamagedEntries) {
   EXPECT_TRUE(outcome.problemTold);
 }
 
-// Every 16 bytes what could be an object, each said to end far away among zeros that do not last.
+// Every 16 bytes there could be an object. By its size each ends far away, in zeros that do not
+// reach the end of the file. If the search looked through these zeros for each object, the test
+// would time out.
 TEST_P(JournalDamageTest, SearchTakesTimeOfTheFilesSize) {
   constexpr size_t kHalf = size_t{4} << 20;
   std::string file = journalOf(0, layout()).bytes();
@@ -175,12 +179,12 @@ TEST_P(JournalDamageTest, SurvivesRandomDamage) {
     withText.compression = kCompressions[seed % 4];
     const std::string file = journalOf(kEntries, withText).bytes();
     const Outcome outcome = read(directory_.write("a.journal", testing::damaged(file, seed)));
-    // Eight stretches of 600 bytes that stand twice are a few entries more at most.
+    // Damage can double eight stretches of 600 bytes at most, which adds a few entries.
     EXPECT_LE(outcome.numbers.size(), kEntries + 50) << seed;
   }
 }
 
-// What may happen to a file while it is read; each at a hundred places.
+// Others change the file while it is read. Each change happens at a hundred places.
 class JournalMeanwhileTest : public ::testing::Test {
  protected:
   static constexpr size_t kEntries = 2000;

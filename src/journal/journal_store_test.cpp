@@ -99,8 +99,7 @@ TEST(JournalStoreTest, DeliversCopiesInOtherFilesOnce) {
   EXPECT_EQ(reading.report.reading.duplicateEntries, 15u);
 }
 
-// Boots that overlap and clocks that were set, in files of several sequences: no order satisfies
-// all of them.
+// The sequences have overlapping boots and clocks that were set, so no order satisfies all rules.
 TEST(JournalStoreTest, DeliversOnceInACircularOrder) {
   constexpr size_t kEntries = 60;
   for (unsigned seed = 0; seed < 10; ++seed) {
@@ -116,7 +115,7 @@ TEST(JournalStoreTest, DeliversOnceInACircularOrder) {
         header.monotonic += 1 + random() % 3;
         header.realtime += 1 + random() % 3;
         writer.add(header, {"MESSAGE=" + std::to_string(random())});
-        // A copy from when the file was not yet as long, and one of all of it.
+        // Writes a copy of the first half, and then one of the whole file.
         if (i % 30 == 29)
           directory.write(std::to_string(sequence) + (i > 30 ? "" : "early") + ".journal",
                           writer.bytes());
@@ -205,7 +204,7 @@ TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
   EXPECT_EQ(reading.entries.at(2).fields, (std::vector<std::string>{"PRIORITY=4"}));
 }
 
-// Anyone may write such entries, with any values.
+// Anyone may write loss messages, with any values.
 TEST(JournalStoreTest, CountsEachOfManyLosses) {
   const TemporaryDirectory directory;
   JournalWriter writer;
@@ -254,7 +253,8 @@ TEST(JournalStoreTest, ReadsTheGoodFilesAmongBadOnes) {
   EXPECT_EQ(reading.report.files.at(1).skipped, "it is empty");
 }
 
-// journalctl does not know the flag either, which is as near as a test comes to a newer one.
+// The journalctl of this machine does not know the flag either, so the test sees it read nothing. A
+// file that only journalctl can read is not at hand.
 TEST(JournalStoreTest, LeavesUnknownFilesToJournalctl) {
   const TemporaryDirectory directory;
   std::string file = someJournal(10);
@@ -273,7 +273,7 @@ TEST(JournalStoreTest, LeavesUnknownFilesToJournalctl) {
       << "no more than the file can hold";
 }
 
-// It would else be decompressed for each of the entry's items.
+// Otherwise the reader would decompress the value for each of the entry's items.
 TEST(JournalStoreTest, DecompressesARepeatedValueOnce) {
   const TemporaryDirectory directory;
   JournalLayout layout;

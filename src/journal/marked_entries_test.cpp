@@ -1,4 +1,4 @@
-// What a reader that is led by a file's index shows, beside what the file holds.
+// Compares the entries that a reader shows by a file's index with those that the file holds.
 
 #include <gtest/gtest.h>
 
@@ -63,7 +63,7 @@ class MarkedEntriesTest : public ::testing::TestWithParam<bool> {
  protected:
   JournalLayout layout() const { return {.compact = GetParam()}; }
 
-  // The numbers of the entries that were shown with their fields, one of which was `field`.
+  // The numbers of the entries that were shown with fields, among them `field`.
   Numbers shown(const std::string& bytes, const std::vector<EntryMark>& marks = kMarks,
                 std::string_view field = "MESSAGE=") {
     testing::RecordingTokenizer tokenizer(marks);
@@ -84,7 +84,7 @@ class MarkedEntriesTest : public ::testing::TestWithParam<bool> {
   }
 
   testing::TemporaryDirectory directory_;
-  std::string problem_;  // the first that the last reading met
+  std::string problem_;  // the first problem of the last reading
 };
 
 INSTANTIATE_TEST_SUITE_P(Layouts, MarkedEntriesTest, ::testing::Bool());
@@ -162,7 +162,7 @@ TEST_P(MarkedEntriesTest, ADamagedIndexHidesNoMark) {
   }
 }
 
-// An offset in a list that leads to no entry may hide the one that it stood for, and no other.
+// A wrong offset in a list hides the entry whose offset it replaced, and no other.
 TEST_P(MarkedEntriesTest, AWrongOffsetHidesOneEntry) {
   const JournalWriter writer = markedJournal(layout());
   std::string file = writer.bytes();

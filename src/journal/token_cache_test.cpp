@@ -1,4 +1,4 @@
-// What is remembered of a place is never taken for what is remembered of another.
+// The cache never returns the token of one place for another.
 
 #include "journal/TokenCache.h"
 

@@ -30,7 +30,8 @@ class Vandal {
     if (at + sizeof value <= file_.size()) std::memcpy(file_.data() + at, &value, sizeof value);
   }
 
-  // Objects are led by their type, so faults aim at words that look like the beginning of one.
+  // An object begins with its type. So this looks for a word that may be the beginning of an
+  // object, and aims near it.
   uint64_t somewhereInAnObject() {
     for (int tries = 0; tries < 200; ++tries) {
       const uint64_t at = below(file_.size() / 8) * 8;
@@ -81,7 +82,7 @@ class Vandal {
         put(kEntryCountAt, random_());
         break;
       default:
-        // One object after itself: what is found twice must not be delivered twice.
+        // Doubles a stretch of the file. An entry that is found twice must not be delivered twice.
         file_.insert(at & ~uint64_t{7}, file_.substr(at & ~uint64_t{7}, length & ~uint64_t{7}));
     }
   }

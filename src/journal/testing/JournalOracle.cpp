@@ -96,7 +96,8 @@ std::vector<PlainEntry> readWithJournalctl(const std::string& path) {
   ExportEntryStream stream(::dup(::fileno(pipe)), resources, tokenizer, stop, report);
   std::vector<PlainEntry> entries = readAll(stream, tokenizer);
   if (::pclose(pipe) != 0 || !report.problems.empty()) entries.clear();
-  // The format has the boot among what says where an entry stands.
+  // In the export format the boot is a part of the header and not a field, so we add the field
+  // here.
   for (PlainEntry& entry : entries) {
     entry.fields.push_back("_BOOT_ID=" + textOf(entry.header.bootId));
     std::sort(entry.fields.begin(), entry.fields.end());
