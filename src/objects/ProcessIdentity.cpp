@@ -1,7 +1,7 @@
 // The walk from an executable image up to its bundle.
 //
-// The walk is on the text of the path alone; the disk is asked once, about the one directory found.
-// Links are not resolved: a bundle is named after the path under which its image was started.
+// The walk only reads the text of the path. The disk is read once, for the directory that the walk
+// found. We resolve no links, so a walk costs no system call, however long the path is.
 
 #include "objects/ProcessIdentity.h"
 
@@ -11,8 +11,8 @@ namespace tessel {
 
 namespace {
 
-// A writer chooses the path, and a path of 4096 bytes can have 2048 directories. Real bundles lie a
-// few levels above their image.
+// Whoever starts a program chooses how deep its directory lies. The limit bounds what the walk for
+// one path costs. A bundle that lies further above its image is not found.
 constexpr int kExaminedDirectoriesLimit = 100;
 
 std::string_view withoutTrailingSeparators(std::string_view path) {
@@ -26,8 +26,8 @@ std::string_view lastComponent(std::string_view path) {
   return trimmed.substr(trimmed.rfind('/') + 1);
 }
 
-// "/" for a path directly below the root. Empty for a single relative component, which has no
-// parent that we could know.
+// The parent of "/a" is "/". The parent of "a" is empty: its directory depends on where the program
+// was started, and the path does not tell that.
 std::string_view parent(std::string_view path) {
   const std::string_view trimmed = withoutTrailingSeparators(path);
   const size_t separator = trimmed.rfind('/');
@@ -36,13 +36,14 @@ std::string_view parent(std::string_view path) {
   return above.empty() ? path.substr(0, 1) : above;
 }
 
-// The nearest directory above the image that is named after it, "Foo.app" for "Foo"; empty if there
-// is none. A directory called "Foo" alone is no bundle, hence the dot.
+// The nearest directory above the image that has the image's name and an extension, such as
+// "Foo.app" for "Foo". Empty if there is none. The prefix ends with a dot, because neither "Foo"
+// nor "Foobar.app" is the bundle of "Foo".
 std::string_view bundleDirectoryAbove(std::string_view imagePath) {
   const std::string prefix = std::string(lastComponent(imagePath)) + ".";
   std::string_view directory = parent(imagePath);
   for (int examined = 0; examined < kExaminedDirectoriesLimit; ++examined) {
-    // The parent of "/" is "/", so going on would only use up the limit.
+    // Nothing lies above either of these.
     if (directory.empty() || directory == "/") return {};
     if (lastComponent(directory).starts_with(prefix)) return directory;
     directory = parent(directory);
@@ -56,8 +57,8 @@ SharedString ProcessIdentity::bundleIdentifierForImagePath(StringRef imagePath) 
   if (!imagePath.present()) return {};
   const auto known = bundleIdentifierCache_.find(imagePath);
   if (known != bundleIdentifierCache_.end()) return known->second;
-  // A path without a bundle is kept as well. Most processes have none, and each of their objects
-  // would otherwise cost a walk and a look at the disk.
+  // We remember a path without a bundle as well. Otherwise each object of its process would cost
+  // another walk.
   return bundleIdentifierCache_.emplace(imagePath, search(imagePath.text())).first->second;
 }
 

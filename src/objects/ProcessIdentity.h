@@ -1,9 +1,11 @@
 // ProcessIdentity: finds the bundle identifier of an executable image.
 //
 // The bundle of an image is the nearest directory above it, within 100 levels, whose name begins
-// with the image's file name and a dot. Every answer is kept for the life of the object, "none"
-// included, so a path costs one walk and at most one bundle lookup. A bundle that is installed or
-// removed later changes nothing for a path that was asked before.
+// with the image's file name and a dot. "Foo.app" is the bundle directory of ".../Foo.app/Foo".
+//
+// The object remembers every answer, also that a path has no bundle. A path therefore costs one
+// walk and at most one bundle lookup. The price: if a bundle is installed or removed later, the
+// answer for a path that was asked before stays the old one.
 //
 // Threads: one at a time.
 
@@ -21,8 +23,8 @@ class ProcessIdentity {
  public:
   explicit ProcessIdentity(BundleReader& bundles) : bundles_(bundles) {}
 
-  // Absent if the image has no bundle or the path is absent. Touches the file system only for a
-  // path that it was not asked for before.
+  // Absent if the image has no bundle or the path is absent. The first call for a path may read
+  // the file system; later calls for it do not.
   SharedString bundleIdentifierForImagePath(StringRef imagePath);
 
  private:

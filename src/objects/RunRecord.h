@@ -1,4 +1,4 @@
-// RunRecord: what a run came to.
+// RunRecord: the result of one run, with all its counts.
 //
 // The run fills it, and main.cpp adds what became of the spool's rows and of the run marker. The
 // record is then kept as `<state>/last_run.json`; each run replaces the record of the run before.
@@ -27,13 +27,13 @@
 namespace tessel {
 
 enum class RunOutcome : uint8_t {
-  completed,    // all of the period was read
-  interrupted,  // a deferral ended the reading early
-  bailedOut,    // the marker of a run that died stood there
-  failed,       // no marker could be made, or the trace store could not be read
-  notTasked,    // nothing was to be reported; such a run leaves no record
+  completed,    // the whole period was read
+  interrupted,  // a deferral was asked for during the run; the reading may have ended early
+  bailedOut,    // the run found the marker of a run that had died, and read nothing
+  failed,       // the marker could not be made, or the trace store could not be read
+  notTasked,    // this machine was not to report; such a run leaves no record
 };
-// Of those that a record may have.
+// The names of all outcomes but notTasked, which no record has.
 inline constexpr std::array<std::string_view, 4> kRunOutcomeNames = {"completed", "interrupted",
                                                                      "bailed_out", "failed"};
 
@@ -46,19 +46,19 @@ struct RunRecord {
   Date start{};
   Date end{};
   RunOutcome outcome = RunOutcome::completed;
-  std::string failure;     // why it failed, in words; empty where it did not
+  std::string failure;     // why the run failed, in words; empty if it did not
   uint64_t logEvents = 0;  // entries read, trace points or not
   uint64_t inspected = 0;  // trace objects
   ClassifiedCounts classified{};
-  uint64_t unnamed = 0;      // reported objects without a name, which send one event instead of two
-  uint64_t countEvents = 0;  // sent or tried
-  // Absent where nothing was read, and in records of a service that kept it in another form.
+  uint64_t unnamed = 0;      // reported objects without a full name: one event each, not two
+  uint64_t countEvents = 0;  // handed to the spool, stored or not
+  // Absent if nothing was read, or if the file has the reading in a form that we do not know.
   std::optional<StoreReading> reading;
 
   uint64_t rowsStored = 0;                                   // in the spool
-  std::vector<std::pair<std::string, uint64_t>> rowsFailed;  // by reason, zero included
-  std::vector<std::string> setAside;                         // damaged spools, by file name
-  std::string marker;  // what became of the run marker, in words
+  std::vector<std::pair<std::string, uint64_t>> rowsFailed;  // every reason, also those with 0 rows
+  std::vector<std::string> setAside;                         // file names of damaged spools
+  std::string marker;                                        // "removed" or "still there"
 
   // Whether the run got as far as sending anything.
   bool hasBooks() const {
@@ -69,8 +69,8 @@ struct RunRecord {
   bool objectsBalance() const {
     return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
   }
-  // Rows that the run should have stored: two for each object reported, one where it has no name,
-  // one for each count, one for the summary.
+  // Rows that the run should have stored. A reported object makes two, or one if it lacks a full
+  // name. Each count event makes one, and so does the summary.
   uint64_t rowsExpected() const { return 2 * reported() - unnamed + countEvents + 1; }
   bool rowsBalance() const { return rowsStored == rowsExpected(); }
 

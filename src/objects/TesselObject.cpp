@@ -1,8 +1,7 @@
-// What the classes of trace objects do themselves: membership, and the analytics payloads.
+// The classes of trace objects: which class an object belongs to, and its analytics payload.
 //
-// A derived class takes the payload of its base and adds to it. Keys are sent in the
-// order in which they are set, so receivers see it, and a new key goes to the end of its class's
-// part.
+// A derived class takes the payload of its base class and adds its own keys at the end. Keys are
+// sent in the order in which they are set, so receivers see any change of that order.
 
 #include "objects/TesselObject.h"
 
@@ -16,7 +15,7 @@ namespace tessel {
 
 namespace {
 
-// One record for the life of the process, so that a payload without a name allocates none.
+// All payloads without a name share this one string, so they need not allocate it.
 const SharedString& unknownText() {
   static const SharedString& text = *new SharedString("Unknown");
   return text;
@@ -27,13 +26,15 @@ struct SlotKeys {
   std::string_view value;
 };
 
-// By slot. Spelled out, because a payload keeps views of its keys: they must be literals.
+// Indexed by slot. A payload keeps views of its keys, so each key must be a literal and cannot be
+// put together from a slot number.
 constexpr std::array<SlotKeys, kLabelledStrings> kStringKeys = {
     {{"String1Name", "String1Value"}, {"String2Name", "String2Value"}}};
 constexpr std::array<SlotKeys, kLabelledNumbers> kNumberKeys = {
     {{"Number1Name", "Number1Value"}, {"Number2Name", "Number2Value"}}};
 
-// A value without its label says nothing to a reader of the event, so it stays out with the label.
+// Without its label a value means nothing to a receiver, so an argument without a label is left out
+// whole. If only the value is absent, the label is sent alone.
 void setLabelledArguments(Payload& payload, const TesselObject& object) {
   for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
     const LabelledString& string = object.labelledStrings()[slot];
@@ -49,15 +50,15 @@ void setLabelledArguments(Payload& payload, const TesselObject& object) {
   }
 }
 
-// Two applications may use one process name, but not one bundle identifier, so that wins.
+// The bundle identifier goes first, because two applications may have the same process name.
 SharedString processNameOf(const EmittingProcess& process, ProcessIdentity& identity) {
   SharedString bundleIdentifier = identity.bundleIdentifierForImagePath(process.imagePath);
   if (bundleIdentifier.present()) return bundleIdentifier;
   return process.name.present() ? SharedString(process.name) : unknownText();
 }
 
-// These two trace on behalf of other applications and name the one in an attribute. The attribute
-// of any other subsystem may mean anything and is ignored.
+// These two writers trace on behalf of other applications, and an attribute names the application.
+// In a trace point of another subsystem the attribute may mean anything, so it is ignored there.
 bool takesBundleIdOverride(const TesselInterval& interval) {
   if (sameString(interval.subsystem(), "com.vantor.morvald")) return true;
   return sameString(interval.subsystem(), "com.vantor.Harrowmere") &&
@@ -66,8 +67,8 @@ bool takesBundleIdOverride(const TesselInterval& interval) {
 
 }  // namespace
 
-// Asked several times for every object, so the class is a value; a dynamic_cast would walk the
-// tree.
+// The filter asks this several times for every object. A comparison of two values is cheaper than a
+// dynamic_cast, which looks the class up in the type information.
 bool TesselSupportObject::isKindOf(TesselClass wanted) const {
   if (class_ == wanted) return true;
   switch (wanted) {
@@ -85,7 +86,8 @@ bool TesselSupportObject::isKindOf(TesselClass wanted) const {
 }
 
 StringRef TesselInterval::attribute(std::string_view key) const {
-  // An interval has 64 attributes at most and usually none, so a search beats a map.
+  // The begin and the end of an interval bring at most 32 attributes each. A list that short is
+  // searched faster than a map is built.
   for (const auto& [name, value] : interval_.attributes) {
     if (sameString(name, key)) return value;
   }

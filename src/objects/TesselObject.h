@@ -34,8 +34,8 @@ class TesselSupportObject {
   TesselSupportObject& operator=(const TesselSupportObject&) = delete;
   virtual ~TesselSupportObject() = default;
 
-  // Also true for a class that the object's class derives from: an animation interval is an
-  // interval and an object, too.
+  // True for the object's own class and for every class above it in the tree. An animation
+  // interval is also an interval, an object and a support object.
   bool isKindOf(TesselClass wanted) const;
 
   virtual bool canGenerateStatoraPayload() const { return false; }
@@ -49,7 +49,7 @@ class TesselSupportObject {
   const TesselClass class_ = TesselClass::supportObject;
 };
 
-// Arguments to which a writer gives a label. A value without a label is never sent.
+// An argument and the label that the writer gave it. A value without a label is never sent.
 struct LabelledString {
   StringRef label;
   StringRef value;
@@ -130,8 +130,8 @@ class TesselEvent final : public TesselObject {
   const EmittingProcess process_;
 };
 
-// What an interval carries beyond a trace point. The processes that opened and closed it may be
-// two.
+// What an interval carries beyond a trace point. One process may begin an interval and another may
+// end it.
 struct IntervalFields {
   EmittingProcess beginEvent;
   EmittingProcess endEvent;

@@ -28,8 +28,7 @@ struct ClassificationRow {
   std::string_view title;  // a few words for people, in lower case
 };
 
-// Every list for people has this order: what is reported, then the reasons against reporting, with
-// those that a developer meets most often first.
+// Every list for people has this order: reported objects first, then the reasons against reporting.
 inline constexpr auto kClassifications = std::to_array<ClassificationRow>({
     {TesselReporterClassificationTelemetryReported, "reported", "reported"},
     {TesselReporterClassificationTelemetryDisabled, "telemetry_disabled",

@@ -1,12 +1,12 @@
 // TesselSupportObjectExtractor: the trace-extraction service as the service uses it.
 //
-// One extractor serves one run. The run sets the callbacks and the option, makes one processing
-// call, and asks for the results after that has returned.
+// One extractor serves one run. The run sets the callbacks and the option and makes one processing
+// call. After the call has returned, the run asks for the results.
 //
-// Delivery: a callback gets one object per call. Calls come one at a time, and all of them before
-// the processing call returns; a callback may sleep. An animation interval only goes to the
-// animation callback. A delivered object stays valid and unchanged for as long as somebody holds
-// it.
+// Delivery: each call of a callback delivers one object. The calls come one at a time, and the last
+// one ends before the processing call returns. A callback may sleep. An animation interval goes to
+// the animation callback and to no other. A delivered object stays valid and unchanged while
+// somebody holds it.
 //
 // Threads: stopProcessing() may be called from any thread, before, during and after processing,
 // and never waits for a callback. Everything else belongs to the thread of the run.
@@ -41,9 +41,9 @@ class TesselSupportObjectExtractor {
   virtual void setEmitEventProcessingBlock(EventCallback callback) = 0;
   virtual void setBuildAnimationCompositeIntervalTimelines(bool build) = 0;
 
-  // Delivers the trace points recorded in [startDate, endDate) from the store at `path`; an absent
-  // path means the system's own. Blocks until all are delivered or a stop has taken effect. False
-  // if processing failed; `errorOut` then says why.
+  // Delivers the trace points recorded in [startDate, endDate) from the store at `path`. An absent
+  // path means the store that this extractor was made for. Blocks until all are delivered or a stop
+  // has taken effect. False if processing failed; `errorOut` then says why.
   virtual bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
                                          Date endDate, std::optional<PlatformError>& errorOut) = 0;
   // Ends the processing call early. A stop before the call began makes it return at once.

@@ -1,7 +1,7 @@
-// PlatformProfile: what is different from platform to platform, in one table.
+// PlatformProfile: one table of all that differs between platforms.
 //
-// It stands beside the whitelist because that is the lowest room that knows the lists which a
-// profile names. Constant data; any thread.
+// A profile names its lists of known strings, so the table stands in the room of the lists.
+// Constant data; any thread.
 
 #pragma once
 
@@ -15,8 +15,8 @@
 
 namespace tessel {
 
-// Codes are numbers of an interface, so a code without a profile may turn up. It is carried along
-// unchanged and has the profile of the unknown platform.
+// A caller may pass a code that has no profile. The filter keeps such a code as it is, and
+// profileOf() answers with the profile of the unknown platform.
 enum class TesselReporterPlatform : uint64_t {
   unknown = 0,
   quarro = 1,
@@ -29,8 +29,8 @@ enum class TesselReporterPlatform : uint64_t {
 // The platform that this build is for; fixed when the service is built.
 constexpr TesselReporterPlatform currentPlatform() { return TesselReporterPlatform::selvin; }
 
-// Of the trace points with this path, each `ratio`-th is reported, `cap` of them at most. An empty
-// category or name stands for any.
+// Of the trace points with this subsystem, category and name, every `ratio`-th is reported, until
+// `cap` of them were. An empty category or name matches any.
 struct DownsampleRow {
   std::string_view subsystem;
   std::string_view category;
@@ -42,13 +42,13 @@ struct DownsampleRow {
 struct PlatformProfile {
   TesselReporterPlatform platform;
   std::string_view name;                        // for people and on command lines
-  std::span<const StringListSource> whitelist;  // together the known strings
+  std::span<const StringListSource> whitelist;  // the known strings are the union of these lists
   std::span<const DownsampleRow> downsampling;  // empty: nothing is downsampled
   bool hasPerfLoggingRule = false;              // see isPerfLoggingOperation()
   bool logsEveryWhitelistLookup = false;
 };
 
-// By code: unknown first, then every platform.
+// The index is the code of the platform, so the unknown platform comes first.
 inline constexpr size_t kPlatformProfiles = 6;
 std::span<const PlatformProfile, kPlatformProfiles> platformProfiles();
 const PlatformProfile& profileOf(TesselReporterPlatform platform);

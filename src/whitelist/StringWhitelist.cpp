@@ -1,6 +1,6 @@
-// Rules and sets of the string whitelist.
+// The rules and the sets of the string whitelist.
 //
-// No set is ever destroyed, because a run may still ask while another thread ends the process.
+// We never destroy a set: a run may still ask it while another thread ends the process.
 
 #include "whitelist/StringWhitelist.h"
 
@@ -18,6 +18,8 @@ StringSet::StringSet(std::span<const StringListSource> lists) {
   }
 }
 
+// Lists repeat some texts. A repeated text is found in the index and is not added again, so size()
+// counts each text once.
 void StringSet::add(std::string_view text) {
   index_.findOrAdd(
       static_cast<uint32_t>(hashText(text)),
@@ -49,8 +51,8 @@ bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef n
 }
 
 bool perfLoggingOperationStringsPass(StringRef component, StringRef action) {
-  // Each in its own set, because a component's name is no action and says something else there.
-  // Presence first: it is cheap, and most such trace points would else build both sets for nothing.
+  // Each role has its own set, so that a component's name does not pass as an action. We check
+  // presence first: a trace point that lacks a string fails without building a set.
   return component.present() && action.present() && perfLoggingComponentSet().contains(component) &&
          perfLoggingActionSet().contains(action);
 }
@@ -68,7 +70,8 @@ const StringSet& perfLoggingActionSet() {
 }
 
 const StringSet& stringWhitelistForPlatform(TesselReporterPlatform platform) {
-  // Each set on its own and only when it is asked for, because its size is logged at that moment.
+  // We build a set only when it is first asked for: building logs its size, and the log shall name
+  // only sets that are in use. Atomic pointers keep the later calls free of the lock.
   static std::array<std::atomic<const StringSet*>, kPlatformProfiles> sets;
   static std::mutex building;
 
@@ -77,7 +80,8 @@ const StringSet& stringWhitelistForPlatform(TesselReporterPlatform platform) {
   const StringSet* set = built.load(std::memory_order_acquire);
   if (set == nullptr) [[unlikely]] {
     const std::lock_guard lock(building);
-    // Another thread may have built it while we waited; the log must name a set only once.
+    // Another thread may have built the set while we waited for the lock. A second set would leak,
+    // and the log would name its size twice.
     set = built.load(std::memory_order_relaxed);
     if (set == nullptr) {
       set = new StringSet(profile.whitelist);

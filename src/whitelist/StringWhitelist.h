@@ -1,7 +1,8 @@
 // The string whitelist: which values of labelled string arguments may leave the machine.
 //
-// One immutable set per platform and two for a special rule, each built on first use and kept for
-// the life of the process. Any thread may ask. Messages go to the service's log.
+// Each platform has one immutable set. The rule for performance logging has two more. A set is
+// built when it is first used and lives as long as the process. Any thread may ask. Messages go to
+// the service's log.
 
 #pragma once
 
@@ -17,8 +18,9 @@
 
 namespace tessel {
 
-// An immutable set of constant texts, which must outlive it. A string brings its hash along, so
-// asking hashes and copies nothing; a text is only looked at where the hashes agree.
+// An immutable set of constant texts. The set only refers to the texts, so they must outlive it.
+// A StringRef carries its hash, so a lookup neither hashes nor copies. It compares texts only if
+// their hashes are equal.
 class StringSet {
  public:
   // The union of all lists; a text that occurs more than once is one element.
@@ -32,24 +34,27 @@ class StringSet {
   void add(std::string_view text);
 
   std::vector<std::string_view> texts_;
-  FlatIndex index_;  // of texts_
+  FlatIndex index_;  // finds the position in texts_
 };
 
-// False on a build with internal diagnostics. Asks, and logs the answer, each time.
+// False on a build with internal diagnostics. Each call asks `variant` anew and logs the answer.
 bool shouldUseStringWhitelist(BuildVariant& variant);
 
-// Whether a trace point is a performance-logging operation. Some platforms have a rule of their own
-// for those: both strings must be known, the first as a component and the second as an action.
+// Whether a trace point is a performance-logging operation. A platform whose profile has
+// hasPerfLoggingRule treats these differently: the first string must be a known component and the
+// second a known action.
 bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef name);
-// Whether both are known, each in its role. An absent string is not known.
+// Whether `component` is a known component and `action` a known action. An absent string is
+// neither.
 bool perfLoggingOperationStringsPass(StringRef component, StringRef action);
 const StringSet& perfLoggingComponentSet();
 const StringSet& perfLoggingActionSet();
 
-// The platform's set; that of the unknown platform is empty. Logs the set's size when it is built.
+// The platform's set. The unknown platform and Lumet have an empty set. Logs the size of the set
+// when it is built, and on every call if the profile has logsEveryWhitelistLookup.
 const StringSet& stringWhitelistForPlatform(TesselReporterPlatform platform);
 
-// Whether `value` is a member of the platform's set; false where it is absent.
+// Whether the platform's set contains `value`. False if `value` is absent.
 bool stringIsWhitelisted(StringRef value, TesselReporterPlatform platform);
 
 }  // namespace tessel

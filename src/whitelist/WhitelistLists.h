@@ -1,7 +1,8 @@
 // The known values of labelled string arguments, one list per role.
 //
-// Each list is constant data in its own order; getting one builds and copies nothing. No text
-// stands in two lists. Any thread may ask.
+// A list is constant data: a call builds and copies nothing. No text stands in two lists. Two lists
+// contain a text more than once, so a count of the lines is not the size of the set. Any thread may
+// ask.
 
 #pragma once
 
@@ -14,9 +15,10 @@ using StringList = std::span<const std::string_view>;
 // One of the functions below.
 using StringListSource = StringList (*)();
 
-// Desktop user-interface components on which a performance-logged operation acts. Repeats some.
+// The desktop's user-interface components on which a performance-logging operation acts. Five texts
+// stand there twice or more.
 StringList perfLoggingComponentNames();
-// Desktop user-interface operations and animation phases. Repeats one.
+// The desktop's user-interface operations and animation phases. "Open" stands there more than once.
 StringList perfLoggingActionNames();
 // Bundle identifiers of the desktop's own applications, agents, utilities and plug-ins.
 StringList desktopBundleIdentifiers();
