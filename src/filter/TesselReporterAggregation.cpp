@@ -1,7 +1,8 @@
 // Counting by (subsystem, category).
 //
-// Pairs with an absent string stay out of the index, since they equal nothing and would only fill
-// it. They are rare: the extraction delivers no object without subsystem and category.
+// A pair with an absent string is not put into the index: it equals no other pair, so no search
+// could find it. A run meets no such pair, because the extraction delivers no object without a
+// subsystem and a category.
 
 #include "filter/TesselReporterAggregation.h"
 
@@ -11,8 +12,10 @@ namespace tessel {
 
 namespace {
 
-// The hash under which a pair is found. The key's own hash() will not do: exclusive or makes it 0
-// for every pair of two equal strings, and a writer is free to record nothing else.
+// The hash of a pair in the index. We cannot use the key's own hash(): it is an exclusive or, and
+// that is 0 for every pair of two equal strings. A writer who records only such pairs would put all
+// of them on one hash, and each search would compare them all. The multiplication by an odd number
+// makes the two strings count differently.
 uint32_t hashOf(StringRef subsystem, StringRef category) {
   constexpr uint64_t kOdd = 0x9e3779b97f4a7c15u;
   const uint64_t mixed = subsystem.hash() * kOdd + category.hash();
@@ -38,13 +41,14 @@ std::string TesselReporterAggregationKey::description() const {
 }
 
 void TesselReporterAggregation::incrementSubsystem(StringRef subsystem, StringRef category) {
-  // First, so that the total holds whichever way the pair is counted.
+  // Both branches below add 1 to one entry, so the total stays the sum of all counts.
   ++totalCount_;
   if (!bothPresent(subsystem, category)) {
     entries_.push_back({Key(subsystem, category), 1});
     return;
   }
-  // A new pair begins at 0, because the increment below is for new and known pairs alike.
+  // A new entry begins at 0, because the last line of this function raises new and known entries
+  // alike.
   const auto add = [&] {
     entries_.push_back({Key(subsystem, category), 0});
     return static_cast<uint32_t>(entries_.size() - 1);
@@ -63,7 +67,7 @@ uint64_t TesselReporterAggregation::countForSubsystem(StringRef subsystem,
 uint64_t TesselReporterAggregation::countForKey(const Key& key) const {
   if (bothPresent(key.subsystem(), key.category()))
     return countForSubsystem(key.subsystem(), key.category());
-  // Such a key equals nothing but itself, so it is known by its place in memory.
+  // A key with an absent string equals only itself, so we look for its address.
   const auto own = std::ranges::find(entries_, &key, [](const Entry& entry) { return &entry.key; });
   return own == entries_.end() ? 0 : own->count;
 }
@@ -73,7 +77,8 @@ TesselReporterAggregation::keysInDescendingCountOrder() const {
   std::vector<const Entry*> order;
   order.reserve(entries_.size());
   for (const Entry& entry : entries_) order.push_back(&entry);
-  // Stable: of equal counts the pair that appeared first comes first, and is the one that is sent.
+  // The summary sends only the first few keys. A stable sort makes that choice depend on nothing
+  // but the order of the objects, so the same store gives the same events.
   std::ranges::stable_sort(order, std::ranges::greater(), &Entry::count);
 
   std::vector<const Key*> keys;

@@ -1,7 +1,7 @@
 // TesselReporterAggregation: how many trace objects each (subsystem, category) pair contributed.
 //
-// Counting copies and hashes no text: a new pair takes a share of the strings that it is given, and
-// a known one takes nothing. An entry has 24 bytes, its place in the index 16 to 32.
+// Counting copies and hashes no text. A new pair takes a reference to each of its strings; a known
+// pair only raises its count. A pair costs 24 bytes for its entry and 16 to 32 in the index.
 //
 // Threads: one at a time. Keys handed out are valid while the aggregation lives.
 
@@ -28,8 +28,8 @@ class TesselReporterAggregationKey {
 
   // Equal keys have equal hashes; an absent string contributes 0.
   uint64_t hash() const { return subsystem_.hash() ^ category_.hash(); }
-  // True if both are the same object, or if all four strings are present and pairwise equal. So a
-  // key with an absent string does not even equal its copies.
+  // True if both are the same object, or if all four strings are present and pairwise equal. A key
+  // with an absent string therefore differs even from its own copy.
   bool isEqual(const TesselReporterAggregationKey& other) const;
   // "subsystem/category"; an absent string reads "(null)".
   std::string description() const;
@@ -51,15 +51,16 @@ class TesselReporterAggregation {
   TesselReporterAggregation(const TesselReporterAggregation&) = delete;
   TesselReporterAggregation& operator=(const TesselReporterAggregation&) = delete;
 
-  // Counts one object. A pair with an absent string equals no key, so each one is a new entry.
+  // Counts one object. A pair with an absent string equals no other pair, so each such object makes
+  // an entry of its own.
   void incrementSubsystem(StringRef subsystem, StringRef category);
 
-  // The pair's count; 0 for a pair that was not counted or has an absent string.
+  // The count of the pair. 0 if the pair was never counted, or if one of its strings is absent.
   uint64_t countForSubsystem(StringRef subsystem, StringRef category) const;
-  // The count of the key that equals `key`; 0 if there is none. A key with an absent string only
-  // finds its count if this aggregation handed it out.
+  // The count of the entry whose key equals `key`; 0 if there is none. A key with an absent string
+  // finds its count only if it is a key of this aggregation itself, not a copy.
   uint64_t countForKey(const Key& key) const;
-  // Every key once, larger counts first; equal counts in the order in which they first appeared.
+  // Every key once, larger counts first. Among equal counts, the pair that appeared first is first.
   std::vector<const Key*> keysInDescendingCountOrder() const;
 
   // The sum of all counts.
@@ -68,7 +69,7 @@ class TesselReporterAggregation {
   const std::deque<Entry>& aggregationDictionary() const { return entries_; }
 
  private:
-  // Says of the number of an entry whether the entry is that of the pair.
+  // Makes a predicate for the index: does the entry with this number belong to the pair?
   auto isPair(StringRef subsystem, StringRef category) const {
     return [=, this](uint32_t number) {
       const Key& key = entries_[number].key;
@@ -77,10 +78,10 @@ class TesselReporterAggregation {
   }
   const Entry* find(StringRef subsystem, StringRef category) const;
 
-  // A deque, because keys that were handed out must stay where they are, and a vector would hold
-  // memory for up to twice the pairs.
+  // A deque, because a pointer to a key must stay valid when the next pair is added. A vector moves
+  // its elements when it grows.
   std::deque<Entry> entries_;
-  FlatIndex index_;  // of the entries whose strings are present
+  FlatIndex index_;  // finds the entries that have both strings
   uint64_t totalCount_ = 0;
 };
 

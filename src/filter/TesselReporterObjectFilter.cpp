@@ -1,8 +1,9 @@
-// The decision about an object, and its counting.
+// The decision about an object, and the counters.
 //
-// This runs for every object of a day, so nothing here allocates, copies or hashes a text. The
-// checks stand in the order of their codes' definition: the cheapest first, and last the one that
-// changes counters, which must only see objects that passed everything else.
+// This code runs for every object of a day. It copies and hashes no text, and it allocates only for
+// a new (subsystem, category) pair. The order of the checks matters: the first check that fails
+// names the reason. Downsampling comes last, because asking it advances its counters, and its ratio
+// shall be one of the objects that passed everything else.
 
 #include "filter/TesselReporterObjectFilter.h"
 
@@ -22,7 +23,9 @@ const TesselObject* asTesselObject(const TesselSupportObject& object) {
   return object.isKindOf(TesselClass::object) ? static_cast<const TesselObject*>(&object) : nullptr;
 }
 
-// Whether exactly the fields of the classification's own rule are set.
+// A failed whitelist names its slot, a failed duration is negative, and failed downsampling names
+// its entry. No other classification has a slot or a negative duration. A reported object may have
+// an entry, too: the one that let it through.
 bool isConsistent(const FilterDecision& decision) {
   const auto code = decision.classification;
   return (decision.stringSlot != 0) ==
@@ -33,7 +36,8 @@ bool isConsistent(const FilterDecision& decision) {
           code != TesselReporterClassificationFailedSCFilter);
 }
 
-// Counts slots from 0; the decision names them from 1, as their accessors do.
+// `slot` is an index from 0. The decision counts from 1, because people see it and the accessors
+// are called string1Value() and string2Value().
 void failSlot(const TesselObject& object, size_t slot, FilterDecision& decision) {
   const LabelledString& string = object.labelledStrings()[slot];
   decision.stringSlot = static_cast<uint8_t>(slot + 1);
@@ -41,8 +45,8 @@ void failSlot(const TesselObject& object, size_t slot, FilterDecision& decision)
   decision.stringValue = string.value;
 }
 
-// A component that is not known is at fault even if the action is not known either: the rule reads
-// the strings in that order.
+// The rule checks the component before the action. If both are unknown, the decision therefore
+// names the component.
 void failSpecialRule(const TesselObject& object, FilterDecision& decision) {
   decision.specialRule = true;
   const bool componentIsKnown = perfLoggingComponentSet().contains(object.string1Value());
@@ -58,7 +62,7 @@ std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::init(
 
 std::shared_ptr<TesselReporterObjectFilter> TesselReporterObjectFilter::initWithPlatform(
     TesselReporterPlatform platform, BuildVariant& variant) {
-  // Nobody knows what may leave a platform that nobody knows.
+  // For an unknown platform no list says what may leave the machine, so there is no filter for it.
   if (platform == TesselReporterPlatform::unknown) return nullptr;
   return std::shared_ptr<TesselReporterObjectFilter>(
       new TesselReporterObjectFilter(platform, variant));
@@ -80,7 +84,7 @@ bool TesselReporterObjectFilter::shouldReportTesselObject(
 
 FilterDecision TesselReporterObjectFilter::inspectTesselObject(const TesselSupportObject& object) {
   const FilterDecision decision = decide(object);
-  // Whoever is shown the reason is shown these fields, so they must name what decided.
+  // Tools show these fields as the reason of the decision, so they must fit the classification.
   TESSEL_INVARIANT(isConsistent(decision));
   incrementTotalForObject(object, decision.classification);
   return decision;
@@ -88,6 +92,7 @@ FilterDecision TesselReporterObjectFilter::inspectTesselObject(const TesselSuppo
 
 FilterDecision TesselReporterObjectFilter::decide(const TesselSupportObject& supportObject) const {
   FilterDecision decision;
+  // The class comes first: the checks after it read fields that only a TesselObject has.
   const TesselObject* object = asTesselObject(supportObject);
   if (object == nullptr || !object->canGenerateStatoraPayload()) {
     decision.classification = TesselReporterClassificationClassNotSupported;
@@ -104,8 +109,9 @@ FilterDecision TesselReporterObjectFilter::decide(const TesselSupportObject& sup
   return decision;
 }
 
-// The special rule comes before the build variant is asked, so it holds on internal builds, too. An
-// operation that passes it is not held against the whitelist, which mixes components and actions.
+// The special rule holds on internal builds, too, so it comes before the question for the build
+// variant. An operation that passes the rule skips the whitelist: the rule has already checked both
+// strings, and more strictly. The whitelist would also take a component's name for an action.
 bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& object,
                                                           FilterDecision& decision) const {
   const bool special = profile_.hasPerfLoggingRule &&
@@ -116,7 +122,7 @@ bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& ob
   }
   if (!shouldUseStringWhitelist(variant_) || special) return true;
   for (size_t slot = 0; slot < kLabelledStrings; ++slot) {
-    // A value without a label never leaves the machine, so it need not be a known one.
+    // A value without a label is never sent, so it need not be a known one.
     const LabelledString& string = object.labelledStrings()[slot];
     if (!string.label.present() || stringIsWhitelisted(string.value, platform_)) continue;
     failSlot(object, slot, decision);
@@ -128,7 +134,8 @@ bool TesselReporterObjectFilter::objectPassesStringFilter(const TesselObject& ob
 bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& object,
                                                           FilterDecision& decision) const {
   if (scnFilter_ == nullptr) return true;
-  // Not shouldReportObject(), which does not tell which entry decided.
+  // We do not call shouldReportObject() of the filter, because it does not tell which entry
+  // decided.
   TRDownsampleEntry* entry = scnFilter_->downsampleEntryForObject(object);
   decision.downsampleEntry = entry;
   return entry == nullptr || entry->shouldReportThisTime();
@@ -137,17 +144,19 @@ bool TesselReporterObjectFilter::objectPassesDownsampling(const TesselObject& ob
 void TesselReporterObjectFilter::incrementTotalForObject(
     const TesselSupportObject& object, TesselReporterClassification classification) {
   const TesselObject* point = asTesselObject(object);
-  // What is no trace point has neither name, and still counts as inspected.
+  // A support object that is no TesselObject has no subsystem and no category. It still counts as
+  // inspected: otherwise the classifications would not add up to the inspected objects.
   const StringRef subsystem = point ? point->subsystem() : StringRef();
   const StringRef category = point ? point->category() : StringRef();
 
-  // Every object goes into the first and into one of the others, so those sum up to the first.
+  // Every object is counted here and under one classification, so the totals of the classifications
+  // add up to the total of the inspected objects.
   allInspected_.incrementSubsystem(subsystem, category);
   if (classification < classified_.size())
     classified_[classification].incrementSubsystem(subsystem, category);
 
   const bool reported = classification == TesselReporterClassificationTelemetryReported;
-  // The most derived class first, because an animation interval is an interval, too.
+  // The animation interval is asked for first, because it is an interval, too.
   if (object.isKindOf(TesselClass::animationInterval)) {
     animations_.count(reported);
   } else if (object.isKindOf(TesselClass::interval)) {

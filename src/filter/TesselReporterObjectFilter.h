@@ -1,12 +1,12 @@
 // TesselReporterObjectFilter: decides for each trace object whether it is reported, says why, and
 // counts it under exactly that reason.
 //
-// A filter serves one run. It is fed objects, and its counters are read after the run has delivered
-// them all. The downsampling filter that it points to is shared by all filters of the process and
-// keeps counting from run to run.
+// A filter serves one run. The run passes it every object and reads its counters after the last
+// one. All filters of a platform share one downsampling filter, which goes on counting from run to
+// run.
 //
-// Threads: one at a time. A decision about a known (subsystem, category) pair allocates nothing.
-// Objects are borrowed for the call.
+// Threads: one at a time. The first object of a (subsystem, category) pair may allocate; later
+// objects of the pair do not. A call only borrows its object.
 
 #pragma once
 
@@ -23,21 +23,21 @@
 
 namespace tessel {
 
-// What the filter decided about one object, and what it decided by. Strings are borrowed from the
-// object. The downsampling entry is borrowed from its filter, and its counters are those of this
-// decision only until the next object.
+// What the filter decided about one object, and why. The strings are borrowed from the object. The
+// downsampling entry is borrowed from its filter, and the next object changes its counters.
 struct FilterDecision {
   TesselReporterClassification classification = TesselReporterClassificationTelemetryReported;
-  // For a failed string whitelist: the slot, counted from 1, its label and its value, and whether
-  // the special rule for performance logging failed it. The value may be absent, the label only
-  // under the special rule.
+  // Set if the string whitelist failed the object: the slot of the string, counted from 1, and its
+  // label and value. `specialRule` says that the rule for performance logging failed it. The value
+  // may be absent. The label may be absent only under the special rule, which ignores labels.
   uint8_t stringSlot = 0;
   bool specialRule = false;
   StringRef stringLabel;
   StringRef stringValue;
-  // For the duration threshold: the duration in seconds.
+  // Set if the duration threshold failed the object; negative then.
   float durationSeconds = 0;
-  // The entry that was asked, whether it let the object through or not; null if none was asked.
+  // The downsampling entry that decided, for or against the object. Null if no entry applies or an
+  // earlier check failed the object.
   const TRDownsampleEntry* downsampleEntry = nullptr;
 
   bool shouldReport() const {
@@ -49,8 +49,8 @@ class TesselReporterObjectFilter {
  public:
   using Aggregation = TesselReporterAggregation;
 
-  // A filter for the platform of this build, with the process-wide downsampling filter. `variant`
-  // must outlive it.
+  // A filter for the platform of this build. It uses the downsampling filter that the whole process
+  // shares. `variant` must outlive it.
   static std::shared_ptr<TesselReporterObjectFilter> init(BuildVariant& variant);
   // The same for another platform; null for TesselReporterPlatform::unknown.
   static std::shared_ptr<TesselReporterObjectFilter> initWithPlatform(
@@ -59,17 +59,18 @@ class TesselReporterObjectFilter {
   TesselReporterObjectFilter(const TesselReporterObjectFilter&) = delete;
   TesselReporterObjectFilter& operator=(const TesselReporterObjectFilter&) = delete;
 
-  // Decides, counts, and says why.
+  // Decides about the object and counts it. Each call counts, so call it once for each object.
   FilterDecision inspectTesselObject(const TesselSupportObject& object);
-  // The same: true if the object is to be reported. `classificationOut` may be null.
+  // Also decides and counts. True if the object is to be reported. `classificationOut` may be null.
   bool shouldReportTesselObject(const TesselSupportObject& object,
                                 TesselReporterClassification* classificationOut);
-  // Counts an object under a classification. An object whose code is not in the table counts as
-  // inspected and as not reported only. Called once per decision.
+  // Counts an object under a classification; the two functions above call it. If the code is not in
+  // the table of classifications, the object counts as inspected and as not reported, and under no
+  // classification.
   void incrementTotalForObject(const TesselSupportObject& object,
                                TesselReporterClassification classification);
 
-  // May be null; then nothing is downsampled.
+  // If the downsampling filter is null, nothing is downsampled.
   const std::shared_ptr<TRSubsystemCategoryNameFilter>& scnFilter() const { return scnFilter_; }
   void setScnFilter(std::shared_ptr<TRSubsystemCategoryNameFilter> filter) {
     scnFilter_ = std::move(filter);
@@ -100,10 +101,10 @@ class TesselReporterObjectFilter {
   const Aggregation& telemetryNotReportedClassNotSupportedAggregation() const {
     return aggregationFor(TesselReporterClassificationClassNotSupported);
   }
-  // The total of each classification.
+  // The number of objects under each classification.
   ClassifiedCounts classifiedCounts() const;
 
-  // Per kind; an animation interval counts as an animation only.
+  // Totals by kind of object. An animation interval counts as an animation and not as an interval.
   uint64_t totalUnreportedIntervalCount() const { return intervals_.unreported; }
   uint64_t totalReportedIntervalCount() const { return intervals_.reported; }
   uint64_t totalUnreportedAnimationCount() const { return animations_.unreported; }

@@ -1,8 +1,8 @@
-// The downsampling tree: tiers, entries and the configuration they are built from.
+// The downsampling tree: its tiers, its entries, and how a configuration becomes a tree.
 //
-// A tree of hash tables makes a decision cost three look-ups at most, however many rows there are.
-// A list of rows would be searched in full for each object that none of them concerns, which is
-// most.
+// Each tier is a hash table, so a decision costs at most three lookups, however many rows the
+// configuration has. If no row names its subsystem, an object costs one lookup. In a list, such an
+// object would be compared with every row.
 
 #include "filter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter.h"
 
@@ -19,24 +19,25 @@ namespace tessel {
 
 namespace {
 
-// Ends the process over an operation that a tier should have defined: a mistake in our own code.
-// Text, file and line are an interface that other programs read, so they do not follow this source
-// file.
+// Ends the process because a tier lacks an operation, which is a mistake in our own code. Other
+// programs read the text with its file and line. Both are therefore constants, which stay the same
+// when this source file changes.
 [[noreturn]] void failAbstractOperation(const char* function, int line) {
   std::fprintf(stderr, "Assertion failed: (false), function %s, file %s, line %d.\n", function,
                "tessel_reporter/SubsystemCategoryFilter/TRSubsystemCategoryNameFilter", line);
   std::abort();
 }
 
-// The number as an unsigned 64-bit integer. A negative integer wraps around, so -1 is a cap that is
-// never reached. Floating point loses its fraction and is held within bounds, because a conversion
-// from outside of them is undefined; the comparison is written so that NaN becomes 0.
+// The number as an unsigned 64-bit integer. A negative integer wraps around, so -1 is a cap that no
+// count reaches. A floating-point number loses its fraction. C++ leaves its conversion undefined
+// outside the range of the integer, so we clamp it first.
 uint64_t unsignedValue(const Number& number) {
   return std::visit(
       [](auto value) -> uint64_t {
         if constexpr (std::is_floating_point_v<decltype(value)>) {
           constexpr auto kAbove = static_cast<double>(std::numeric_limits<uint64_t>::max());
           const auto wide = static_cast<double>(value);
+          // Every comparison with NaN is false, so this form also returns 0 for NaN.
           if (!(wide > 0)) return 0;
           return wide >= kAbove ? std::numeric_limits<uint64_t>::max()
                                 : static_cast<uint64_t>(wide);
@@ -73,7 +74,9 @@ bool TRDownsampleEntry::shouldReportThisTime() {
   const uint64_t seen = eventsSeen() + 1;
   setEventsSeen(seen);
   const uint64_t reported = eventsReported();
-  // An object beyond the cap still counts as seen: the ratio is one of all objects.
+  // Only one thread changes the counters, so a separate load and store lose nothing. They are
+  // atomic for the threads that read them. An object after the cap was reached still counts as
+  // seen, so eventsSeen() tells how many objects there were.
   if (reported >= cap_ || seen % downsampleRatio_ != 0) return false;
   setEventsReported(reported + 1);
   return true;
@@ -81,7 +84,8 @@ bool TRDownsampleEntry::shouldReportThisTime() {
 
 TRDownsampleEntry* FilterTier::entryForQuery(const FilterQuery& query) const {
   const StringRef key = keyForChildren(query);
-  // A child without an entry on the path does not decide, and this tier's own entry applies.
+  // The child is asked first, because the more specific entry decides. If no tier further down has
+  // an entry for the query, this tier's own entry applies.
   if (key.present()) {
     const auto child = childTiers_->find(key);
     if (child != childTiers_->end()) {
@@ -188,7 +192,8 @@ std::optional<DownsampleConfiguration> defaultConfigurationForPlatform(
 std::shared_ptr<TRSubsystemCategoryNameFilter> defaultFilterForPlatform(
     TesselReporterPlatform platform) {
   using Filters = std::vector<std::shared_ptr<TRSubsystemCategoryNameFilter>>;
-  // Never destroyed: a run may still ask while another thread ends the process.
+  // We never destroy the filters: a run may still use one while another thread ends the process.
+  // All are made at the first call, so that later calls only read and need no lock.
   static const Filters& filters = *new Filters([] {
     Filters made;
     for (const PlatformProfile& profile : platformProfiles())

@@ -8,8 +8,8 @@
 // tree decides; an object whose path has none is let through. Once a filter is built, only the
 // counters of its entries change, and they count for as long as the filter lives.
 //
-// Threads: one at a time uses a filter; any thread may read the counters of an entry. Asking copies
-// and hashes no text.
+// Threads: one thread at a time may use a filter. Any thread may read the counters of an entry. A
+// lookup copies and hashes no text.
 
 #pragma once
 
@@ -43,10 +43,11 @@ class FilterQuery {
   StringRef name_;
 };
 
-// Lets through each object whose running number is a multiple of the ratio, up to a cap.
+// Numbers its objects from 1 and lets through those whose number is a multiple of the ratio, until
+// it has let `cap` objects through.
 class TRDownsampleEntry {
  public:
-  // Null and a log line for a ratio of 0. A cap of 0 lets nothing through.
+  // Null for a ratio of 0, which is also logged. A cap of 0 lets nothing through.
   static std::unique_ptr<TRDownsampleEntry> initWithCap(uint64_t cap, uint64_t downsampleRatio);
 
   // Whether the next object is let through. Counts it as seen and, if so, as reported.
@@ -90,16 +91,18 @@ class FilterTier {
   FilterTier& operator=(const FilterTier&) = delete;
   virtual ~FilterTier() = default;
 
-  // The entry for the query in this tier or below; null if there is none. Borrowed until replaced.
+  // The most specific entry for the query, in this tier or below it; null if there is none. The
+  // pointer is valid until setCap() replaces the entry.
   TRDownsampleEntry* entryForQuery(const FilterQuery& query) const;
-  // Puts a fresh entry into the tier where the query's first string is absent. It replaces the
-  // entry there; a ratio of 0 leaves none.
+  // Follows the strings of the query down the tree and stops at the first absent one. The tier
+  // there gets a new entry with counters at 0 in place of its old one. With a ratio of 0 it gets
+  // none.
   void setCap(uint64_t cap, uint64_t downsampleRatio, const FilterQuery& query);
 
-  // The string of the query that chooses the child; absent in a leaf. Stops the process in a class
-  // that does not define it.
+  // The string of the query that chooses the child; absent in a leaf. Every tier overrides this;
+  // the version of the base class ends the process.
   virtual StringRef keyForChildren(const FilterQuery& query) const;
-  // A tier of the next level. Stops the process in a leaf.
+  // A new tier of the next level. A leaf has no next level, so there this ends the process.
   virtual std::unique_ptr<FilterTier> newChildInstance() const;
 
   // Null in a leaf.
@@ -147,22 +150,24 @@ class FilterNameTier final : public FilterTier {
   StringRef keyForChildren(const FilterQuery&) const override { return {}; }
 };
 
-// One dictionary per entry: "Subsystem", "Cap" and "DownsampleRatio", optionally "Category" and
-// "Name". A value of the wrong type is taken for absent.
+// Each dictionary describes one entry. "Subsystem", "Cap" and "DownsampleRatio" are required;
+// "Category" and "Name" are optional. A value of the wrong type counts as absent.
 using DownsampleConfiguration = std::vector<ConfigurationValue::Dictionary>;
 
 class TRSubsystemCategoryNameFilter {
  public:
-  // Null for an absent configuration. Null and a log line for a row that lacks a required value;
-  // the rows after it are not read. A row with a ratio of 0 makes no entry.
+  // Null if the configuration is absent, or if a row lacks a required value. Such a row is logged,
+  // and the rows after it are not read. A row with a ratio of 0 makes no entry.
   static std::shared_ptr<TRSubsystemCategoryNameFilter> initWithDictionaryArray(
       const std::optional<DownsampleConfiguration>& configuration);
 
-  // True when the object may be reported. Advances the counters of the entry that applies to it.
+  // True if the object may be reported. Advances the counters of the entry that applies to it.
   bool shouldReportObject(const TesselObject& object);
-  // The entry that applies to the object; null if there is none. Borrowed until replaced.
+  // The entry that applies to the object; null if there is none. Changes no counter. The pointer is
+  // valid until addEntryWithSubsystem() replaces the entry.
   TRDownsampleEntry* downsampleEntryForObject(const TesselObject& object) const;
-  // Puts a fresh entry at the path; its strings may be absent. See FilterTier::setCap().
+  // Puts a new entry at this path of the tree. Any of the strings may be absent. See
+  // FilterTier::setCap().
   void addEntryWithSubsystem(StringRef subsystem, StringRef category, StringRef name, uint64_t cap,
                              uint64_t downsampleRatio);
 
@@ -175,16 +180,18 @@ class TRSubsystemCategoryNameFilter {
   const std::unique_ptr<FilterTier> filterTreeRoot_;
 };
 
-// The downsampling of the platform's profile; absent if that downsamples nothing.
+// The downsampling rows of the platform's profile; absent if the profile has none.
 std::optional<DownsampleConfiguration> defaultConfigurationForPlatform(
     TesselReporterPlatform platform);
 
-// The filter made of it that all runs of the process share, because a cap holds for the process:
-// its counters go on from run to run. Null where there is no configuration. Any thread may ask.
+// The filter with the platform's default configuration. All runs of the process share it, so a cap
+// holds for the life of the process and not for one run. Null if the platform has no such
+// configuration. Any thread may ask.
 std::shared_ptr<TRSubsystemCategoryNameFilter> defaultFilterForPlatform(
     TesselReporterPlatform platform);
 
-// A filter of its own from the same configuration, with counters at zero; null as above.
+// A new filter with the same configuration and with all counters at 0. Null if the platform has no
+// such configuration.
 std::shared_ptr<TRSubsystemCategoryNameFilter> makeDefaultFilterForPlatform(
     TesselReporterPlatform platform);
 
