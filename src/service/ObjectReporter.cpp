@@ -1,4 +1,7 @@
-// Filter, payload, pacing and the two sends of one object.
+// The way of one object: filter, payload, pacing, two sends.
+//
+// An object that the filter holds back costs no payload and no pacing. A payload is made once, and
+// both events share it.
 
 #include "service/ObjectReporter.h"
 
@@ -12,8 +15,8 @@ namespace tessel {
 
 namespace {
 
-// Two objects with different names must not share an event, so an object that lacks a part of the
-// name has no such event.
+// The name of the second event has three parts. If one were left empty, different kinds of objects
+// could share an event name, so an object without all three has no second event.
 bool hasEventName(const TesselObject& object) {
   return object.subsystem() && object.category() && object.name();
 }
@@ -29,10 +32,10 @@ std::string eventName(const TesselObject& object) {
 }  // namespace
 
 BootVolumeFacts bootVolumeFacts(Volumes& volumes) {
-  // The disk is not asked for: receivers only know this one type.
+  // The type of the disk is a constant: every machine reports "SSD", whatever disk it has.
   BootVolumeFacts facts{{}, SharedString("SSD")};
   const std::optional<std::string> filesystem = volumes.rootFilesystemTypeName();
-  // The mount table is raw bytes, and a payload must be text.
+  // A payload must be valid UTF-8, but the mount table may contain any bytes.
   if (filesystem && isValidUtf8(*filesystem)) {
     tesselReporterLog().debug("Filesystem for '/': %@", *filesystem);
     facts.filesystem = SharedString(*filesystem);
@@ -55,12 +58,13 @@ std::optional<Payload> reportPayload(const TesselObject& object, ProcessIdentity
 
 void EventRoad::send(const std::shared_ptr<const TesselObject>& object,
                      const std::shared_ptr<const Payload>& payload) {
-  // The delivering thread sleeps, not the queue, so the extractor slows down to the pace of the
-  // sends instead of filling the queue.
+  // The throttle sleeps on this thread, which is the one that delivers objects. The extractor
+  // therefore slows down to the pace of the sends. If the queue slept instead, it would fill up.
   throttle_.throttleReportedEvent();
   reportingQueue_.async(
       [this, payload] { sender_.sendEvent("com.vantor.performance.tessel", *payload); });
-  // An object without an event of its own is paced like any other.
+  // An object without a second event takes this step, too. The pace of a run therefore only depends
+  // on the number of reported objects.
   throttle_.throttleReportedEvent();
   reportingQueue_.async([this, object, payload] {
     if (hasEventName(*object)) sender_.sendEvent(eventName(*object), *payload);
@@ -76,7 +80,8 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
     return true;
   }
   if (!hasEventName(*object)) ++unnamedCount_;
-  // The record of the run expects two rows for each reported object and takes the unnamed ones off.
+  // The run's record expects two rows for each reported object, less one for each unnamed object.
+  // More unnamed than reported objects would make that number meaningless.
   TESSEL_INVARIANT(unnamedCount_ <= filter_->telemetryReportedAggregation().totalCount());
   road_.send(object, std::make_shared<const Payload>(*std::move(payload)));
   return true;

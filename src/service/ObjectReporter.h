@@ -1,4 +1,5 @@
-// ObjectReporter: what happens to one delivered trace object, from the filter to two queued sends.
+// ObjectReporter: takes one delivered trace object through the filter, makes its payload and queues
+// its two events.
 
 #pragma once
 
@@ -16,29 +17,30 @@
 
 namespace tessel {
 
-// What every payload says of the boot volume. The filesystem may be absent.
+// What every payload says about the boot volume. The filesystem may be absent.
 struct BootVolumeFacts {
   SharedString filesystem;
   SharedString disk;
 };
 
-// The facts of this machine. Logs the filesystem type, or that it could not be determined or is not
-// valid UTF-8, in which case it is absent.
+// The facts of this machine. The filesystem is absent if it is unknown or its name is not valid
+// UTF-8. Both facts are logged.
 BootVolumeFacts bootVolumeFacts(Volumes& volumes);
 
-// The payload that is sent for a reportable object; absent if none can be made.
+// The payload of a reportable object, with the boot volume added. Absent if the object has none.
 std::optional<Payload> reportPayload(const TesselObject& object, ProcessIdentity& identity,
                                      const BootVolumeFacts& bootVolume);
 
-// The way of an object's events: paced on the calling thread, sent on the reporting queue. Lives as
-// long as the process.
+// Sends the events of an object. Pacing happens on the calling thread, sending on the reporting
+// queue. The queued jobs refer to the road, so it must live as long as the process.
 class EventRoad {
  public:
   EventRoad(Throttle& throttle, EventSender& sender, SerialQueue& reportingQueue)
       : throttle_(throttle), sender_(sender), reportingQueue_(reportingQueue) {}
 
-  // Sends the payload twice: as the event of all objects, and as one named after the object if that
-  // has all three names. Sleeps where the sends go too fast. The queued sends hold what they send.
+  // Queues two events with the same payload. The first has the name that all objects share. The
+  // second is named after the object; an object without subsystem, category or name has no second.
+  // Sleeps if the sends come too fast. The queued jobs keep the object and the payload alive.
   void send(const std::shared_ptr<const TesselObject>& object,
             const std::shared_ptr<const Payload>& payload);
 
@@ -48,10 +50,10 @@ class EventRoad {
   SerialQueue& reportingQueue_;
 };
 
-// One run's reporting. The three callbacks of the extractor share it.
+// Reports the objects of one run. The three callbacks of the extractor share it.
 //
-// Threads: reportTesselObject() runs on the delivering thread, one object at a time. Everything
-// else belongs to the thread of the run, once all objects have been delivered.
+// Threads: reportTesselObject() runs on the delivering thread, one object at a time. The thread of
+// the run may use the other functions once all objects have been delivered.
 class ObjectReporter {
  public:
   ObjectReporter(std::shared_ptr<TesselReporterObjectFilter> filter, BootVolumeFacts bootVolume,
@@ -61,11 +63,11 @@ class ObjectReporter {
         identity_(identity),
         road_(road) {}
 
-  // Always true, which tells the extractor to go on.
+  // Always returns true: the extractor shall go on.
   bool reportTesselObject(const std::shared_ptr<const TesselObject>& object);
 
   const TesselReporterObjectFilter& filter() const { return *filter_; }
-  // Reported objects without a name, for which one event is sent instead of two.
+  // Reported objects that lack subsystem, category or name. They send one event instead of two.
   uint64_t unnamedCount() const { return unnamedCount_; }
 
  private:

@@ -1,4 +1,8 @@
-// The steps of a run, in their order.
+// The steps of a run.
+//
+// The order protects against a store that kills its reader. The marker is made before anything is
+// read and removed after the summary. A run that dies in between leaves it for the next run to
+// find.
 
 #include "service/ReportingRun.h"
 
@@ -11,11 +15,13 @@ namespace {
 
 constexpr char kTransactionName[] = "com.vantor.tessel.tessel_reporter_activity transaction";
 
-// A day, as long as the interval between two runs. A run that comes late leaves a gap, one that
-// comes early reports some trace points twice: which ones were read is not kept anywhere.
+// Nothing remembers which trace points earlier runs have read. If two runs are more than a day
+// apart, no run reads the trace points between. If they are less than a day apart, the second run
+// reports some trace points again.
 constexpr std::chrono::seconds kLookBack{86400};
 
-// Whoever asks for a deferral waits for us this long at most, plus the leeway.
+// The poll notices a deferral after at most 20 s: the interval and the leeway. The run then still
+// sends its summary.
 constexpr std::chrono::nanoseconds kPollInterval{10'000'000'000};
 constexpr std::chrono::nanoseconds kPollLeeway{10'000'000'000};
 
@@ -38,7 +44,7 @@ RunRecord endedWith(RunOutcome outcome, std::string failure = {}) {
   return record;
 }
 
-// Why the extraction failed, in words; absent if it did not.
+// Returns why the extraction failed, in words; absent if it did not fail.
 std::optional<std::string> extract(TesselSupportObjectExtractor& extractor, Date startDate,
                                    Date endDate) {
   std::optional<PlatformError> error;
@@ -63,7 +69,8 @@ void CookieFile::clearCookieFile() {
   if (result.removed) {
     tesselReporterLog().debug("Cleared cookie file");
   } else {
-    // An error, because the next run will take the marker for that of a run that died.
+    // This is an error, because the next run will find the marker, think that this run died, and
+    // read nothing.
     tesselReporterLog().error("Could not clear cookie file: %@",
                               result.error.value_or("Unknown error"));
   }
@@ -84,7 +91,8 @@ std::shared_ptr<const std::atomic<bool>> DeferralPoll::start(
     const std::shared_ptr<TesselSupportObjectExtractor>& extractor) {
   const auto interrupted = std::make_shared<std::atomic<bool>>(false);
   const auto queue = queues_.makeSerialQueue("tessel_reporter defer polling queue");
-  // Weak, because the poll outlives the run, and an extractor holds the strings of a whole day.
+  // The poll outlives the run. A strong reference would keep the extractor, with the strings of a
+  // whole day, in memory until the process ends.
   const std::weak_ptr<TesselSupportObjectExtractor> weakExtractor = extractor;
   queues_
       .makeRepeatingTimer(queue, kPollInterval, kPollLeeway,
@@ -111,18 +119,20 @@ RunRecord TraceReading::report(const std::shared_ptr<Activity>& activity) {
   RunRecord record =
       endedWith(failure ? RunOutcome::failed : RunOutcome::completed, failure.value_or(""));
   record.logEvents = extractor->processedEventCount();
-  // On the queue behind all sends of the run, so what it sums up has been sent before.
+  // The summary queues up behind all sends of the run, so every event that it counts has been sent
+  // before it.
   reportingQueue_.sync([&] {
     record.countEvents = summary_.reportRunSummary(filter, record.logEvents, startDate, endDate,
                                                    *interrupted, startTime);
   });
-  // A deferral may come as late as during the summary; it is asked for last.
+  // A deferral may still come during the summary, so we look after it. The run then counts as
+  // interrupted, even if it had read everything. A failure is the weightier outcome and stays.
   if (!failure && *interrupted) record.outcome = RunOutcome::interrupted;
   record.reading = extractor->reading();
   record.unnamed = reporter->unnamedCount();
   record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
   record.classified = filter.classifiedCounts();
-  // Each object that was inspected was reported or held back for exactly one reason.
+  // Each inspected object was either reported or held back, and for exactly one reason.
   TESSEL_INVARIANT(record.objectsBalance());
   return record;
 }
@@ -131,7 +141,8 @@ void TraceReading::installCallbacks(TesselSupportObjectExtractor& extractor,
                                     const std::shared_ptr<ObjectReporter>& reporter) {
   const auto reportTesselObject =
       [reporter, &status = status_](const std::shared_ptr<const TesselObject>& object) {
-        // The service manager kills a service that shows no progress for too long.
+        // The service manager kills a service that shows no progress. An object is a step even if
+        // it is held back, because a long stretch of such objects is no sign of hanging.
         status.progress();
         return reporter->reportTesselObject(object);
       };
@@ -153,13 +164,14 @@ RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
   status_.say("waiting for the tasking configuration");
   if (!gate_.shouldReport()) return endedWith(RunOutcome::notTasked);
   if (cookie_.cookieFileExists()) {
-    // The run that left the marker may have died of what it read, so this run reads nothing. It
-    // takes the marker away, so that the next one does.
+    // What the dead run read may have killed it, so this run reads nothing. It removes the marker,
+    // so the next run reads again.
     tesselReporterLog().debug("Bailing due to cookie file");
     cookie_.clearCookieFile();
     return endedWith(RunOutcome::bailedOut);
   }
-  // Without a marker a run that dies would not be noticed, and the next would die the same way.
+  // If this run died without a marker, nobody would notice. The next run would read the same store
+  // and could die of it as well.
   if (!cookie_.createCookieFile())
     return endedWith(RunOutcome::failed, "the run marker could not be made");
   RunRecord record = reading_.report(activity);
@@ -168,7 +180,8 @@ RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
 }
 
 void ReporterActivity::handleActivity(const std::shared_ptr<Activity>& changed) {
-  // A share of our own: the activity must live until the transaction is closed.
+  // We hold a reference of our own, because the activity must live until the transaction is closed.
+  // The order of these two lines matters: the transaction is destroyed first.
   // NOLINTNEXTLINE(performance-unnecessary-copy-initialization)
   const std::shared_ptr<Activity> activity = changed;
   const auto transaction = runtime_.openTransaction(kTransactionName);
@@ -180,12 +193,13 @@ void ReporterActivity::handleActivity(const std::shared_ptr<Activity>& changed) 
   } else {
     tesselReporterLog().debug("Unknown state %ld\n", state);
   }
-  // Only asked for here: the process ends when the transaction is closed, not in the middle of it.
+  // This only asks for the exit. The transaction is still open here, and the process does not end
+  // before it is closed.
   runtime_.requestCleanExit();
 }
 
 void ReporterActivity::runOrDefer(const std::shared_ptr<Activity>& activity) {
-  // If the scheduler does not take the deferral, nobody would start the run later, so it runs now.
+  // If the scheduler rejects the deferral, it will not start the run later. So we run now.
   if (activity->shouldDefer() && activity->setState(kActivityStateDefer)) {
     tesselReporterLog().debug("Deferred tessel_reporter\n");
     return;

@@ -1,13 +1,14 @@
-// What the service does when its background activity changes state, down to one reporting run.
+// ReportingRun: one reporting run, and the change of activity state that starts it.
 //
 //   ReporterActivity -> ReportingRun -> TraceReading
 //   state changes       gate, marker    extractor, filter, sends, summary
 //
-// A run is a chain of decisions that each may end it, so each link owns its own: whether to run
-// now, whether the machine reports and no earlier run died half-way, and what is read and sent.
+// Each of the three classes takes one decision. ReporterActivity decides whether to run now.
+// ReportingRun decides whether this machine may report, and whether the run before died half-way.
+// TraceReading then reads, reports and sums up.
 //
-// Threads: everything runs on the scheduler's thread and returns when all is done, the summary
-// included. Only the deferral poll has a queue of its own.
+// Threads: a run blocks the scheduler's thread until the summary is done. Sends and summary run on
+// the reporting queue, and the deferral poll on a queue of its own.
 
 #pragma once
 
@@ -30,31 +31,31 @@ namespace tessel {
 
 inline constexpr char kActivityName[] = "com.vantor.tessel.tessel_reporter_activity";
 
-// The run marker, an empty file that exists exactly while a run reports. Only its existence counts:
-// a marker that a new run finds says that an earlier run died half-way.
+// The run marker is an empty file that exists while a run reports. If a new run finds a marker, an
+// earlier run died half-way. Only the existence of the file counts.
 inline constexpr char cookieFilePath[] = "/var/tmp/tessel_reporter_running";
 class CookieFile {
  public:
   explicit CookieFile(FileManager& files) : files_(files) {}
 
-  // True if anything stands at the path, even a directory.
+  // True if there is anything at the path, even a directory.
   bool cookieFileExists();
-  // Removes whatever stands at the path. Logs an error if that fails.
+  // Removes whatever is at the path. Logs an error if that fails.
   void clearCookieFile();
-  // True only if this call made the file.
+  // True only if this call made the file. False if there was a marker already.
   bool createCookieFile();
 
  private:
   FileManager& files_;
 };
 
-// Asks an activity every ten seconds whether it should defer, and then stops the extraction.
+// Asks an activity every ten seconds whether it should defer. If so, stops the extraction.
 class DeferralPoll {
  public:
   explicit DeferralPoll(QueueFactory& queues) : queues_(queues) {}
 
-  // The answer becomes true with the first deferral. The poll goes on for as long as the process
-  // lives; it keeps the activity, but not the extractor.
+  // The returned value becomes true at the first deferral and stays true. The poll goes on until
+  // the process ends. It keeps the activity alive, but not the extractor.
   std::shared_ptr<const std::atomic<bool>> start(
       const std::shared_ptr<Activity>& activity,
       const std::shared_ptr<TesselSupportObjectExtractor>& extractor);
@@ -66,7 +67,7 @@ class DeferralPoll {
 // Makes the reporter of a run, with a filter of its own.
 using ReporterFactory = std::function<std::shared_ptr<ObjectReporter>()>;
 
-// Reads the last 24 hours, reports them and sums up.
+// Reads the trace points of the last 24 hours, reports them and sums up.
 class TraceReading {
  public:
   // `runSummary` runs on `reportingQueue`.
@@ -81,7 +82,7 @@ class TraceReading {
         clock_(clock),
         status_(status) {}
 
-  // All of the record but its times and what only spool and marker know.
+  // Fills the whole record except for the times and for what only the spool and the marker show.
   RunRecord report(const std::shared_ptr<Activity>& activity);
 
  private:
@@ -97,8 +98,8 @@ class TraceReading {
   ServiceStatus& status_;
 };
 
-// Given the record of each run on the run's thread, after its last step. The callback adds what the
-// run cannot know: what the spool stored, and whether the marker is gone.
+// Gets the record of each run, on the run's thread, after the last step of the run. The callback
+// adds what the run cannot know: what the spool stored, and whether the marker is gone.
 using RunEndedCallback = std::function<void(const RunRecord&)>;
 
 class ReportingRun {

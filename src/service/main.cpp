@@ -1,8 +1,8 @@
 // Composition root of the service: makes every part, in order, and hands each what it needs.
 //
-// What is made here is never destroyed. The process may end at any moment and on any thread, and
-// the other threads must not meet a part that is half gone. Arguments are ignored; the environment
-// is the launch configuration.
+// We never destroy a part. The process may end at any moment and on any thread, and the other
+// threads must not use a part that is half destroyed. The service takes its configuration from the
+// environment and ignores its arguments.
 
 #include <csignal>
 #include <cstdio>
@@ -25,8 +25,8 @@
 namespace tessel {
 namespace {
 
-// Makes a T that lives as long as the process. A list keeps it reachable, because a leak checker
-// reports what nothing points to.
+// Makes a T that lives as long as the process. The list points to it, because a leak checker
+// reports an object that nothing points to.
 template <typename T, typename... Args>
 T& keep(Args&&... args) {
   static auto& kept = *new std::deque<T*>;
@@ -60,8 +60,8 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
   }
 }
 
-// Leaves the record of a run for `tesselctl status`, and readies the spool for the next run. Only
-// the spool knows what it stored, and it knows that only once it is closed.
+// Writes the record of a run for `tesselctl status`, and prepares the spool for the next run. The
+// spool knows how many rows it stored only after endRun(), so endRun() comes first.
 void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirectory) {
   spool.endRun();
   if (record.outcome != RunOutcome::notTasked) {
@@ -74,7 +74,7 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
   spool.beginRun();
 }
 
-// What is read, and the way of each object from the store to the spool.
+// Makes the parts that take an object from the store to the spool.
 TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& variant, Spool& spool,
                           QueueFactory& queues, SerialQueue& reportingQueue, Clock& clock,
                           ServiceStatus& status) {
@@ -84,8 +84,8 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
   auto& volumes = keep<MountTable>();
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   const auto makeExtractor = [store = launch.traceStore, &status] {
-    // Not make_shared(): the poll of a past run still has a weak reference, and that would hold the
-    // memory of the whole extractor.
+    // The poll of a past run keeps a weak reference. make_shared() puts the object and its counter
+    // into one block, so a weak reference would keep the memory of the whole extractor.
     std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store));
     extractor->reportProgressTo(status);
     return extractor;
@@ -108,7 +108,7 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
                             [&spool, &state, &reportingQueue](const RunRecord& record) {
-                              // The spool belongs to this queue.
+                              // Only this queue may use the spool; all sends run there, too.
                               reportingQueue.sync([&] { keepRecord(record, spool, state.path()); });
                             });
 }
@@ -124,8 +124,8 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   const auto processingQueue = std::make_shared<WorkerQueue>("tessel_reporter processing queue");
   auto& reportingQueue = keep<WorkerQueue>("tessel_reporter Statora reporting queue");
   const auto interruptSource = runtime.makeSignalSource(SIGINT, processingQueue);
-  // At once, in the middle of a run if need be: the marker that it leaves makes the next run bail
-  // out.
+  // SIGINT ends the process at once, even in the middle of a run. That run leaves its marker, so
+  // the next run bails out.
   interruptSource->setHandler([] { std::exit(0); });
 
   auto& activity =
@@ -137,7 +137,7 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   scheduler.registerActivity(kActivityName, [&activity](const std::shared_ptr<Activity>& changed) {
     activity.handleActivity(changed);
   });
-  // Last, so that a signal never meets a service that is half made.
+  // This comes last, so that no signal is handled before every part is made.
   interruptSource->resume();
   runtime.runMainLoop();
 }

@@ -1,7 +1,7 @@
-// Sections, run-summary event, closing line.
+// The sections, the run-summary event and the closing line.
 //
-// Headings, payload keys and the closing line are an interface that other programs read. Their
-// texts stay as they are, line breaks included.
+// Other programs read the headings, the payload keys and the closing line. Their texts must not
+// change, and neither must the line breaks in them.
 
 #include "summary/RunSummary.h"
 
@@ -12,8 +12,8 @@ namespace tessel {
 
 namespace {
 
-// A day can have thousands of pairs, and the spool takes a row for each event. Those that are
-// counted most tell most, and the log has all of them.
+// A run may count 4096 pairs in each of six sections, and each count event is a row in the spool.
+// The limit keeps a run at 30 such rows. We send the largest counts; the log has all of them.
 constexpr uint64_t kSentPerSection = 5;
 
 struct Section {
@@ -22,6 +22,8 @@ struct Section {
   std::string_view classification;
 };
 
+// An object can be in several sections: a reported event is in the first three. So the totals of
+// the sections do not add up to the first one.
 using Filter = TesselReporterObjectFilter;
 
 constexpr Section kSections[] = {
@@ -49,6 +51,7 @@ Payload countPayload(const TesselReporterAggregationKey& key, uint64_t count,
   return payload;
 }
 
+// The three kinds of object make up six counts. An object of no kind is in none of them.
 Payload runSummaryPayload(const TesselReporterObjectFilter& filter, uint64_t logEvents,
                           float seconds, bool interrupted) {
   Payload payload;
@@ -68,7 +71,8 @@ Payload runSummaryPayload(const TesselReporterObjectFilter& filter, uint64_t log
 
 uint64_t CountReporter::reportCountForKey(const TesselReporterAggregationKey& key,
                                           const TesselReporterAggregation& aggregation) {
-  // Also for a key that is only logged: the pace of a section does not depend on what it sends.
+  // A key that is only logged takes a step as well. At 80 steps a second, a section of 4096 keys
+  // therefore takes about 51 s, however few of its keys are sent.
   throttle_.throttleReportedEvent();
   const uint64_t count = aggregation.countForKey(key);
   if (sentCount_ == kSentPerSection) {
@@ -91,7 +95,8 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter, 
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
                     runSummaryPayload(filter, logEvents, seconds, interruptedByDeferral));
   const LogHandle& log = tesselReporterLog();
-  // Formatting two dates costs more than all the counts, so it is not done for nobody.
+  // log.debug() gets its arguments ready-made. We ask first whether the line is logged, so that
+  // the two dates are not formatted in vain.
   if (log.isEnabled(LogLevel::debug)) {
     log.debug(
         "Done processing %llu reported and %llu unreported events, %llu reported and %llu "
@@ -109,6 +114,7 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter, 
         dates_.format(startDate), dates_.format(endDate),
         interruptedByDeferral ? " (Interrupted by deferral)" : "");
   }
+  // The throttle serves the whole process, so these totals include the runs before this one.
   if (throttle_.throttledCount() != 0) {
     log.debug("Throttled %llu times for a total of %llu usec", throttle_.throttledCount(),
               throttle_.throttledMicroseconds());
@@ -120,15 +126,19 @@ uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
   uint64_t sent = 0;
   for (const Section& section : kSections) {
     const TesselReporterAggregation& aggregation = (filter.*section.aggregation)();
-    // The heading stands even over an empty section, so that a log shows that nothing was counted.
+    // An empty section gets a heading, too. The log then shows that nothing was counted, and not
+    // that the summary ended early.
     tesselReporterLog().debug(section.header, aggregation.totalCount());
     CountReporter counts(sender_, throttle_, section.classification);
     uint64_t counted = 0;
     for (const TesselReporterAggregationKey* key : aggregation.keysInDescendingCountOrder()) {
-      status_.progress();  // a section may take minutes; the service manager must see it alive
+      // A full section takes about 51 s, all six up to five minutes. Without a sign of progress the
+      // service manager would take the process for hung and kill it.
+      status_.progress();
       counted += counts.reportCountForKey(*key, aggregation);
     }
-    // What the heading says is the sum of the lines below it.
+    // The heading's total is the sum of the counts below it. If it is not, a key was lost or
+    // counted twice.
     TESSEL_INVARIANT(counted == aggregation.totalCount());
     sent += counts.sentCount();
   }
@@ -136,7 +146,8 @@ uint64_t RunSummary::reportSections(const TesselReporterObjectFilter& filter) {
 }
 
 float RunSummary::secondsSince(uint64_t startTime) {
-  // Continuous ticks, because a machine that sleeps during a run was still processing it.
+  // The continuous clock goes on while the machine sleeps. The duration therefore includes a sleep
+  // in the middle of a run.
   const uint64_t endTime = clock_.continuousTicks();
   const Timebase timebase = clock_.timebase();
   const double secondsPerTick =

@@ -1,10 +1,11 @@
-// RunSummary: the books of a run, at its end.
+// RunSummary: accounts for all objects of a run when the run ends.
 //
-// It logs six sections of counts and sends up to five count events for each, then sends one
-// run-summary event and logs the closing line, and the throttle's totals if it ever slept.
+// It logs six sections of counts and sends up to five count events for each section. Then it sends
+// one run-summary event and logs the closing line. If the throttle ever slept, it also logs for how
+// long.
 //
-// Threads: a summary is one job on the reporting queue, submitted after every send of the run and
-// after the extraction has returned. One object serves the whole process.
+// Threads: a summary is one job on the reporting queue. It is submitted after the extraction has
+// returned, and so after every send of the run. One object serves the whole process.
 
 #pragma once
 
@@ -18,13 +19,13 @@
 
 namespace tessel {
 
-// Handles the keys of one section: an event for each of the first five, a log line for every one.
+// Reports the keys of one section. The first five get an event each; every key gets a log line.
 class CountReporter {
  public:
   CountReporter(EventSender& sender, Throttle& throttle, std::string_view classification)
       : sender_(sender), throttle_(throttle), classification_(classification) {}
 
-  // Answers the key's count. REQUIRES: `aggregation` holds `key`.
+  // Returns the count of the key. REQUIRES: `key` is a key of `aggregation`, not a copy.
   uint64_t reportCountForKey(const TesselReporterAggregationKey& key,
                              const TesselReporterAggregation& aggregation);
   // Events sent so far.
@@ -43,10 +44,10 @@ class RunSummary {
              ServiceStatus& status)
       : sender_(sender), throttle_(throttle), clock_(clock), dates_(dates), status_(status) {}
 
-  // `logEvents` is how many the extractor read. `startDate` and `endDate` bound the period that was
-  // read; `processingStartTime` is in ticks of the continuous clock. `interruptedByDeferral` may
-  // change while the summary runs, because the deferral poll does not stop for it. Answers how many
-  // count events were sent.
+  // `logEvents` is the number of log events that the extractor read. `startDate` and `endDate`
+  // bound the period. `processingStartTime` is in ticks of the continuous clock. The deferral poll
+  // goes on during the summary, so `interruptedByDeferral` may change meanwhile. Returns the number
+  // of count events sent.
   uint64_t reportRunSummary(const TesselReporterObjectFilter& filter, uint64_t logEvents,
                             Date startDate, Date endDate,
                             const std::atomic<bool>& interruptedByDeferral,

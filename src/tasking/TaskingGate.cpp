@@ -1,6 +1,6 @@
-// The rules of tasking, their lines in the log, and the wait for the configuration.
+// The rules of tasking, their log lines, and the wait for the configuration.
 //
-// Every doubt means no: a machine that was not asked to report must not, whatever went wrong.
+// A machine that nobody asked to report must not report. So whatever goes wrong here means "no".
 
 #include "tasking/TaskingGate.h"
 
@@ -13,8 +13,8 @@ namespace tessel {
 
 namespace {
 
-// The scheduler's thread waits here. A configuration that exists is delivered in milliseconds; five
-// seconds leave room for a busy machine and still do not hold up the scheduler.
+// The scheduler's thread waits here, so the wait must have an end. A run waits at most 5 s. A
+// configuration that arrives later only counts for the next run.
 constexpr std::chrono::nanoseconds kConfigurationWait{5'000'000'000};
 
 struct ReasonRow {
@@ -32,7 +32,7 @@ constexpr ReasonRow kReasons[] = {
      "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
     {TaskingReason::noneArrived, TaskingSource::absent,
      "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"},
-    // The line of this one names the type, which only logDecision() knows.
+    // This line names the type that arrived, so logged() writes it.
     {TaskingReason::unexpectedType, TaskingSource::unusable, ""},
     {TaskingReason::nilConfiguration, TaskingSource::unusable,
      "Not reporting based on not being tasked-on by Statora (nil configuration object)"},
@@ -45,7 +45,8 @@ constexpr ReasonRow kReasons[] = {
      "Not reporting since not tasked-on by Statora (Wrong value class for class for TaskedOn)"},
 };
 
-// rowOf() takes the reason for the place in the table.
+// rowOf() uses the reason as the index. A reason without a row would read past the end of the
+// table.
 static_assert([] {
   for (size_t place = 0; place < std::size(kReasons); ++place) {
     if (static_cast<size_t>(kReasons[place].reason) != place) return false;
@@ -68,7 +69,8 @@ TaskingDecision logged(TaskingDecision decision, const std::string& type = {}) {
   return decision;
 }
 
-// Shared by the waiting gate and the callback, because the callback may outlive the gate's call.
+// The gate and its callback share this, because the callback may still run after the gate's call
+// has returned. Whichever of the two ends last frees it.
 struct SharedAnswer {
   Semaphore arrived{0};
   std::atomic<TaskingDecision> decision;
@@ -87,7 +89,7 @@ TaskingDecision decideTasking(BuildVariant& buildVariant,
 
 TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* configuration,
                                                 const std::string& type) {
-  // The service may deliver any configuration that somebody in this process observes.
+  // Another configuration may have the same key. It must not task this machine.
   if (type != kTaskingType) return {TaskingReason::unexpectedType};
   if (configuration == nullptr) return {TaskingReason::nilConfiguration};
   const auto* dictionary = std::get_if<ConfigurationValue::Dictionary>(&configuration->value);
@@ -98,7 +100,7 @@ TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* config
 
 TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value) {
   if (value == nullptr) return {TaskingReason::noAnswer};
-  // A text is no answer, not even "true": we would have to guess what its author meant.
+  // Only a number is an answer. A text is none, not even "true".
   const auto* number = std::get_if<Number>(&value->value);
   if (number == nullptr) return {TaskingReason::answerNotANumber};
   return {booleanValue(*number) ? TaskingReason::taskedOn : TaskingReason::taskedOff};
@@ -107,7 +109,8 @@ TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value)
 TaskingDecision TaskingGate::decide() {
   const TaskingDecision decision =
       decideTasking(buildVariant_, [this] { return awaitTaskingConfiguration(); });
-  // A configuration that arrived was logged on its arrival.
+  // The callback has already logged a configuration that arrived. A second line would make one
+  // decision look like two.
   const bool arrived = decision.source() == TaskingSource::configuration ||
                        decision.source() == TaskingSource::unusable;
   return arrived ? decision : logged(decision);
@@ -116,13 +119,14 @@ TaskingDecision TaskingGate::decide() {
 TaskingDecision TaskingGate::awaitTaskingConfiguration() {
   const auto queue = queues_.makeSerialQueue("tessel_reporter configuration observing queue");
   const auto answer = std::make_shared<SharedAnswer>();
-  // A new observer for each run: its first delivery is the configuration as it is now.
+  // Each run makes a new observer, because a new observer is told the configuration of this moment.
   const auto observer = configurations_.makeObserver();
   observer->setDelegate(std::make_shared<TesselReporterConfigObserverDelegate>(
                             [answer](const std::shared_ptr<const ConfigurationValue>& configuration,
                                      const std::string& type) {
-                              // Several may arrive before the gate looks. The last one decides,
-                              // since it is newest.
+                              // Several may arrive before the gate reads the answer. The newest
+                              // decides, so each one overwrites the one before. The answer is
+                              // stored before the signal, so the gate never reads an empty one.
                               answer->decision = logged(
                                   taskingDecisionForConfiguration(configuration.get(), type), type);
                               answer->arrived.signal();

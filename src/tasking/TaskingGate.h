@@ -1,10 +1,10 @@
-// TaskingGate: whether a run may report at all, and why.
+// TaskingGate: decides whether a run may report at all, and says why.
 //
-// A build with internal diagnostics may. Any other build may only if the tasking configuration
-// arrives within 5 seconds, is a dictionary, and holds under "TaskedOn" a number that is true.
-// Every decision is logged in one debug line.
+// A build with internal diagnostics may report. Any other build needs the tasking configuration. It
+// must arrive within 5 seconds, be a dictionary, and have a number under "TaskedOn" that is true.
+// Each decision is logged in one debug line.
 //
-// The rules are functions of their own, so that a tool which shows the decision applies the same.
+// The rules are free functions, so a tool that shows the decision applies the same rules.
 
 #pragma once
 
@@ -23,7 +23,7 @@ namespace tessel {
 
 // A build with internal diagnostics for this subsystem reports without being tasked.
 inline constexpr std::string_view kBuildVariantSubsystem = "com.vantor.tessel";
-// The configuration that tasks, and the key of its answer.
+// The type of the tasking configuration, and the key under which it says yes or no.
 inline constexpr char kTaskingType[] = "com.vantor.performance.tessel_reporter_tasking";
 inline constexpr char kTaskedOnKey[] = "TaskedOn";
 
@@ -31,20 +31,20 @@ enum class TaskingReason : uint8_t {
   internalBuild,
   taskedOn,
   taskedOff,
-  noneArrived,     // within the time that the gate waits
-  unexpectedType,  // a configuration arrived that is not the tasking configuration
+  noneArrived,     // the gate's wait ended before a configuration arrived
+  unexpectedType,  // a configuration arrived, but not the tasking configuration
   nilConfiguration,
   noDictionary,
-  noAnswer,  // nothing stands under "TaskedOn"
+  noAnswer,  // the dictionary has no "TaskedOn"
   answerNotANumber,
 };
 
-// What a decision rests on.
+// What made the decision.
 enum class TaskingSource : uint8_t {
   internalBuild,
-  configuration,  // it says yes or no
-  absent,         // there is no configuration
-  unusable,       // there is a configuration, but it does not say
+  configuration,  // the configuration says yes or no
+  absent,         // no configuration arrived
+  unusable,       // something arrived, but it says neither yes nor no
 };
 
 struct TaskingDecision {
@@ -56,17 +56,17 @@ struct TaskingDecision {
   TaskingSource source() const;
 };
 
-// The decision on this build. `askConfiguration` is called only where the build does not decide.
+// Decides by the build alone if that is possible, and otherwise calls `askConfiguration`.
 TaskingDecision decideTasking(BuildVariant& buildVariant,
                               const std::function<TaskingDecision()>& askConfiguration);
-// The decision that one delivered configuration yields; null is an absent one.
+// The decision for one delivered configuration. Null stands for a configuration that is absent.
 TaskingDecision taskingDecisionForConfiguration(const ConfigurationValue* configuration,
                                                 const std::string& type);
-// The decision for what stands under "TaskedOn"; null if nothing does.
+// The decision for the value under "TaskedOn". Null means that there is no such value.
 TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value);
 
-// Keeps nothing between calls. A configuration that arrives after the gate has returned is judged
-// and logged as usual and changes nothing.
+// A gate keeps nothing between calls. If a configuration arrives after decide() has returned, it
+// may still be logged, but it changes nothing.
 class TaskingGate {
  public:
   TaskingGate(BuildVariant& buildVariant, ConfigurationService& configurations,
@@ -93,7 +93,7 @@ class TaskingGate {
 // the analytics service keeps the delegate, even after the gate has returned.
 class TesselReporterConfigObserverDelegate final : public ConfigurationObserverDelegate {
  public:
-  // Takes the configuration, null if it is absent, and its type.
+  // Gets the configuration and its type. The configuration is null if it is absent.
   using CallbackBlock =
       std::function<void(const std::shared_ptr<const ConfigurationValue>&, const std::string&)>;
 
