@@ -19,7 +19,7 @@ Key key(const char* subsystem, const char* category) {
 
 void increment(TesselReporterAggregation& aggregation, const char* subsystem,
                const char* category) {
-  // Strings of their own for every call, as they come from different extractions.
+  // Each call makes new strings, as each extraction does.
   const Key own = key(subsystem, category);
   aggregation.incrementSubsystem(own.subsystem(), own.category());
 }
@@ -121,7 +121,7 @@ TEST(AggregationTest, KeepsItsStringsAlive) {
 }
 
 TEST(AggregationTest, CountsAsAPlainMapDoes) {
-  // Pairs of two equal strings are among them, which exclusive or would put on one hash.
+  // Some pairs have two equal strings. An exclusive or would give all of these the same hash.
   std::mt19937 random(7);
   StringPool pool;
   TesselReporterAggregation aggregation;

@@ -54,7 +54,7 @@ void addEntry(TRSubsystemCategoryNameFilter& filter, const Path& path, uint64_t 
                                cap, ratio);
 }
 
-// The cap of the entry that applies to an object at `path`; nothing where none does.
+// The cap of the entry that applies to an object at `path`; absent if no entry applies.
 std::optional<uint64_t> capAt(const TRSubsystemCategoryNameFilter& filter, const Path& path) {
   const auto* entry = filter.downsampleEntryForObject(*objectAt(path));
   return entry ? std::optional(entry->cap()) : std::nullopt;
@@ -76,7 +76,7 @@ TEST(DownsamplingTest, ARowThatLacksAValueMakesNoFilter) {
   };
   for (const auto& each : cases) {
     const testing::RecordingLog log;
-    // The row after it would be logged, too, were it read.
+    // The second row is faulty as well. It is not logged, because it is not read.
     EXPECT_EQ(filterOf({good, each.bad, row(path, whole(1), whole(0))}), nullptr);
     EXPECT_EQ(log.lines(), std::vector<std::string>{each.message});
   }

@@ -167,7 +167,7 @@ TEST_F(ObjectFilterTest, QuarroHasARuleOnEveryBuild) {
       EXPECT_EQ(decision.shouldReport(), passes) << internal << row.failingSlot;
       EXPECT_EQ(decision.stringSlot, row.failingSlot);
       EXPECT_EQ(decision.specialRule, !passes);
-      // Where the rule fails the object, nobody asks which whitelist mode is on.
+      // If the rule fails the object, the whitelist mode is not asked for.
       EXPECT_EQ(log.lines().size(), passes ? 1u : 0u);
     }
   }

@@ -11,7 +11,7 @@ namespace {
 
 class ProcessIdentityTest : public ::testing::Test {
  protected:
-  // The identifier for the path, "none" where there is none.
+  // The identifier for the path, or "none" if it has no bundle.
   std::string lookUp(const std::string& path) {
     return std::string(identity.bundleIdentifierForImagePath(SharedString(path)).textOr("none"));
   }
@@ -27,7 +27,7 @@ TEST_F(ProcessIdentityTest, TheNearestNamedDirectoryWins) {
     bool found;
   } cases[] = {{"/apps/ID/Foo.app/Foo", "/apps/ID/Foo.app", true},
                {"/x/Foo.app/a/b/Foo", "/x/Foo.app", true},
-               // The first match decides, even where it is no bundle.
+               // The nearest match decides, even if it is no bundle.
                {"/x/Foo.app/Foo.noBundle/Foo", "/x/Foo.app", false},
                {"/x/Foo.framework/Foo", "/x/Foo.framework", true},
                {"Foo.app/Foo", "Foo.app", true},
@@ -73,7 +73,7 @@ TEST_F(ProcessIdentityTest, KeepsAnswersAndLogsFinds) {
     EXPECT_EQ(lookUp("/x/Foo.app/Foo"), "com.vantor.Foo");
     EXPECT_EQ(lookUp("/x/Bar.app/Bar"), "none");
     EXPECT_FALSE(identity.bundleIdentifierForImagePath({}).present());
-    // What the file system says later changes nothing.
+    // A bundle that changes later does not change the answer.
     bundles.identifiers = {{"/x/Bar.app", "com.vantor.Bar"}};
   }
   EXPECT_EQ(bundles.asked.size(), 2u);

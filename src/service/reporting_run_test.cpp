@@ -195,7 +195,7 @@ TEST_F(RunTest, AnUnknownFilesystemLeavesItsKeyOut) {
   EXPECT_EQ(log.count("Could not determine filesystem type"), 2u);
 }
 
-// Of a class that says it has a payload and has none.
+// The class of this object says that it has a payload, but makes none.
 struct WithoutPayload final : TesselObject {
   using TesselObject::TesselObject;
   bool canGenerateStatoraPayload() const override { return true; }
