@@ -76,7 +76,7 @@ TEST(DownsamplingTest, ARowThatLacksAValueMakesNoFilter) {
   };
   for (const auto& each : cases) {
     const testing::RecordingLog log;
-    // The second row is faulty as well. It is not logged, because it is not read.
+    // The last row, with a ratio of 0, would be logged as well if it were read.
     EXPECT_EQ(filterOf({good, each.bad, row(path, whole(1), whole(0))}), nullptr);
     EXPECT_EQ(log.lines(), std::vector<std::string>{each.message});
   }
