@@ -208,8 +208,11 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
     report.outsideRange = true;
     return;
   }
+  // The token cache tells files apart by a number below kMaxFiles. The place in the report may be
+  // larger, because files that could not be opened stand there as well.
+  TESSEL_INVARIANT(usableFiles <= kMaxFiles);
   merger.add(std::make_unique<JournalEntryStream>(
-                 std::move(file.fd), size, header, number,
+                 std::move(file.fd), size, header, usableFiles - 1,
                  JournalEntryStream::Context{resources, tokenizer, marks, stop, report}),
              number, header.sequenceId);
 }
