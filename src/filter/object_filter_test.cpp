@@ -245,7 +245,7 @@ TEST_F(ObjectFilterTest, CountsByReasonAndByKind) {
     ++ofKind[kind][decision.shouldReport()];
   }
   EXPECT_EQ(filter->classifiedCounts(), expected);
-  for (const auto& [code, name, title] : kClassifications) {
+  for (const auto& [code, name, title, column] : kClassifications) {
     EXPECT_GT(expected[code], 0u) << name;
     uint64_t sum = 0;
     for (const auto& entry : filter->aggregationFor(code).aggregationDictionary())

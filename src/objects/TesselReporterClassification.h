@@ -26,19 +26,22 @@ struct ClassificationRow {
   TesselReporterClassification code;
   std::string_view name;   // on command lines and in files
   std::string_view title;  // a few words for people, in lower case
+  // The column of narrow tables that counts it. Rare ones share the last, "OTHER".
+  std::string_view column;
 };
 
 // Every list for people has this order: reported objects first, then the reasons against reporting.
 inline constexpr auto kClassifications = std::to_array<ClassificationRow>({
-    {TesselReporterClassificationTelemetryReported, "reported", "reported"},
+    {TesselReporterClassificationTelemetryReported, "reported", "reported", "REPORTED"},
     {TesselReporterClassificationTelemetryDisabled, "telemetry_disabled",
-     "not marked for telemetry"},
+     "not marked for telemetry", "DISABLED"},
     {TesselReporterClassificationFailedStringWhitelist, "string_whitelist",
-     "a text value is not a known one"},
-    {TesselReporterClassificationDurationThreshold, "duration", "negative duration"},
-    {TesselReporterClassificationFailedSCFilter, "downsampled", "held back by downsampling"},
+     "a text value is not a known one", "UNKNOWN"},
+    {TesselReporterClassificationDurationThreshold, "duration", "negative duration", "OTHER"},
+    {TesselReporterClassificationFailedSCFilter, "downsampled", "held back by downsampling",
+     "THINNED"},
     {TesselReporterClassificationClassNotSupported, "class_not_supported",
-     "kind cannot be reported"},
+     "kind cannot be reported", "OTHER"},
 });
 
 // Trace objects by classification code.

@@ -285,7 +285,7 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
 const CommandText kCompare{
     "compare", "Say what would start and what would stop being reported",
     "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
-    "no-internal, a platform (Quarro, Selvin, Darrow, Fennic, Lumet), since=DATE, until=DATE,\n"
+    "no-internal, a platform (as for --platform), since=DATE, until=DATE,\n"
     "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
     "trace\n"
     "points are compared that are reported at all.\n\n"

@@ -181,19 +181,17 @@ int recordPoint(RecordOptions& options, const std::string& kind) {
 template <size_t N>
 void addSlotOptions(CLI::App& app, const std::string& name,
                     std::array<std::optional<std::string>, N>& pairs, const std::string& what) {
-  static constexpr const char* kOrdinals[] = {"First", "Second"};
-  static_assert(N <= std::size(kOrdinals));
   for (size_t slot = 0; slot < N; ++slot) {
-    app.add_option(name + std::to_string(slot + 1), pairs[slot], kOrdinals[slot] + what)
-        ->type_name("LABEL=VALUE");
+    const std::string number = std::to_string(slot + 1);
+    app.add_option(name + number, pairs[slot], what + " " + number)->type_name("LABEL=VALUE");
   }
 }
 
 void addPointOptions(CLI::App& app, RecordedPoint& point) {
   app.add_flag("--telemetry", point.telemetry,
                "Mark it for telemetry; what is not marked is never reported");
-  addSlotOptions(app, "--string", point.strings, " labelled string");
-  addSlotOptions(app, "--number", point.numbers, " labelled number, decimal");
+  addSlotOptions(app, "--string", point.strings, "Labelled string");
+  addSlotOptions(app, "--number", point.numbers, "Labelled number, decimal");
   app.add_option("--duration", point.duration, "Duration to state in place of the measured one")
       ->type_name("SECONDS");
   app.add_option("--frame-rate", point.frameRate,

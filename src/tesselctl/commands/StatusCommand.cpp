@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <nlohmann/json.hpp>
 
 #include "os/Files.h"
 #include "platform/Text.h"
@@ -158,7 +157,7 @@ class Screen {
     if (status_.runWithoutRecord()) {
       more(std::string(status_.run ? "A later run began " : "A run began ") +
            since(*status_.lastBegin) +
-           " and left no record: it was not tasked, is under way, or died.");
+           " and left no record: it was not tasked, or the record could not be written.");
     }
   }
 

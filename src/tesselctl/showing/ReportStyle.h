@@ -2,6 +2,11 @@
 
 #pragma once
 
+#include <algorithm>
+#include <string_view>
+
+#include "objects/TesselReporterClassification.h"
+
 namespace tessel::ctl {
 
 inline constexpr char kReportStyle[] = R"css(
@@ -93,5 +98,22 @@ footer { font-size: .85rem; padding: .5rem 0; }
   details:not([open]) { display: none; }
 }
 )css";
+
+// How often `text` stands in the style between `before` and `end`.
+constexpr size_t timesInStyle(std::string_view before, std::string_view text,
+                              std::string_view end) {
+  const std::string_view style = kReportStyle;
+  size_t times = 0;
+  for (size_t at = style.find(text); at != style.npos; at = style.find(text, at + 1)) {
+    times +=
+        style.substr(0, at).ends_with(before) && style.substr(at + text.size()).starts_with(end);
+  }
+  return times;
+}
+// A bar without a colour would not be seen, and nobody would miss it. Each classification has a
+// colour in the light, the dark and the printed page, and a rule that uses it.
+static_assert(std::ranges::all_of(kClassifications, [](const ClassificationRow& row) {
+  return timesInStyle("--", row.name, ":") == 3 && timesInStyle("\n.", row.name, " {") == 1;
+}));
 
 }  // namespace tessel::ctl

@@ -140,7 +140,7 @@ std::string more(size_t listed, size_t all, std::string_view what) {
 }
 
 struct PairColumn {
-  const char* title;
+  std::string_view title;
   std::vector<TesselReporterClassification> verdicts;
 
   uint64_t count(const VerdictCounts& counts) const {
@@ -150,20 +150,17 @@ struct PairColumn {
   }
 };
 
-// The columns that are not zero throughout; what is reported is always shown. Verdicts that have no
-// column of their own share the last one, so the columns of a row sum up to its objects.
+// The columns that are not zero throughout; what is reported is always shown. Every verdict has a
+// column, so the columns of a row sum up to its objects.
 std::vector<PairColumn> pairColumns(const VerdictCounts& all) {
-  std::vector<PairColumn> columns = {
-      {"REPORTED", {TesselReporterClassificationTelemetryReported}},
-      {"DISABLED", {TesselReporterClassificationTelemetryDisabled}},
-      {"UNKNOWN", {TesselReporterClassificationFailedStringWhitelist}},
-      {"THINNED", {TesselReporterClassificationFailedSCFilter}}};
-  PairColumn other{"OTHER", {}};
-  for (const auto verdict : kVerdictOrder) {
-    const auto shows = [&](const PairColumn& column) { return column.verdicts[0] == verdict; };
-    if (std::ranges::none_of(columns, shows)) other.verdicts.push_back(verdict);
+  std::vector<PairColumn> columns;
+  for (const bool shared : {false, true}) {
+    for (const ClassificationRow& row : kClassifications) {
+      if ((row.column == "OTHER") != shared) continue;
+      if (!shared || columns.back().title != row.column) columns.push_back({row.column, {}});
+      columns.back().verdicts.push_back(row.code);
+    }
   }
-  columns.push_back(std::move(other));
   std::erase_if(columns, [&](const PairColumn& column) {
     return column.verdicts.front() != TesselReporterClassificationTelemetryReported &&
            column.count(all) == 0;
@@ -175,7 +172,8 @@ std::string pairTable(const Tally& tally, const Terminal& terminal) {
   const auto counted = pairColumns(tally.verdicts());
   std::vector<Table::Column> columns = {{"SUBSYSTEM", Table::Align::left, true},
                                         {"CATEGORY", Table::Align::left, true}};
-  for (const PairColumn& column : counted) columns.push_back({column.title, Table::Align::right});
+  for (const PairColumn& column : counted)
+    columns.push_back({std::string(column.title), Table::Align::right});
   Table table(std::move(columns));
   const auto pairs = tally.pairs();
   for (size_t at = 0; at < std::min(pairs.size(), kShownPairs); ++at) {
