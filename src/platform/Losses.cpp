@@ -61,7 +61,8 @@ void Losses::add(Loss loss) {
   const LossCode code = loss.code;
   uint64_t& sum = sums_[static_cast<size_t>(code)];
   sum += loss.count;
-  const auto [first, last] = std::ranges::equal_range(losses_, code, {}, &Loss::code);
+  const auto first = std::ranges::lower_bound(losses_, code, {}, &Loss::code);
+  const auto last = std::ranges::upper_bound(losses_, code, {}, &Loss::code);
   // The "other" loss stays the last of its code, so a new loss goes in before it.
   const auto other = first != last && std::prev(last)->isOther() ? std::prev(last) : last;
   auto known = std::find_if(first, last, [&](const Loss& one) { return isSame(one, loss); });
