@@ -35,12 +35,13 @@ struct ExplainOptions {
 // the pattern matcher only where there is a pattern.
 bool chosen(const ExplainOptions& options, const TesselObject& object,
             TesselReporterClassification verdict) {
-  const auto fits = [](const std::vector<std::string>& patterns, StringRef text) {
-    return patterns.empty() || fitsOne(patterns, std::string(text.textOr("")));
+  const auto fits = [](const std::vector<std::string>& patterns, std::string_view text) {
+    return patterns.empty() || fitsOne(patterns, std::string(text));
   };
-  return fits(options.subsystems, object.subsystem()) &&
-         fits(options.categories, object.category()) && fits(options.names, object.name()) &&
-         fitsOne(options.verdicts, std::string(verdictName(verdict)));
+  return fits(options.subsystems, object.subsystem().textOr("")) &&
+         fits(options.categories, object.category().textOr("")) &&
+         fits(options.names, object.name().textOr("")) &&
+         fits(options.verdicts, verdictName(verdict));
 }
 
 // Builds the payload with the code and the facts of a run, identities of processes included.
