@@ -14,7 +14,8 @@ constexpr const char* kFooter =
     "Exit status: 0 done; 1 the answer is bad; 2 usage; 4 no access.\n"
     "'tesselctl COMMAND --help' says more about a command.";
 
-// Help that fits 80 columns.
+// Help that fits 80 columns. The parser would not break a long description, and a terminal would
+// continue it at the left edge, among the names of the options.
 class NarrowFormatter final : public CLI::Formatter {
  public:
   NarrowFormatter() { column_width(kColumn); }
@@ -27,8 +28,8 @@ class NarrowFormatter final : public CLI::Formatter {
   static constexpr size_t kWidth = 80;
 };
 
-// Takes the words behind "--" off the arguments. They are another program's, and the parser would
-// read its options as ours.
+// Takes the words behind "--" off the arguments. They belong to another program, and the parser
+// would read its options as ours. Absent means no "--"; empty means that nothing followed it.
 std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& arguments) {
   const auto dashes = std::find(arguments.begin(), arguments.end(), "--");
   if (dashes == arguments.end()) return std::nullopt;
@@ -52,7 +53,7 @@ int run(std::vector<std::string> arguments) {
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);
   addReportCommand(app, invocation);
-  // The parser would complain about a missing subcommand and not name the word that is wrong.
+  // The parser would only say that a subcommand is missing. We name the word that is wrong.
   if (!arguments.empty() && !arguments[0].starts_with('-') &&
       app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
           .empty()) {
@@ -65,6 +66,8 @@ int run(std::vector<std::string> arguments) {
     if (app.get_subcommands().empty() && !app.remaining().empty()) {
       return fail(kUsage, "no command is called '" + app.remaining().front() + "'; see --help");
     }
+    // The parser reports --help as an error of status 0. Its other statuses are numbers of its own,
+    // and a script knows only ours.
     return app.exit(error) == 0 ? kDone : kUsage;
   }
   return invocation.status;

@@ -16,12 +16,13 @@ namespace tessel::ctl {
 
 namespace {
 
-// The exit status comes from the code alone. A path may hold any words, "Permission denied" too.
+// The exit status depends on the error code alone. We never search the words of an error, since
+// they contain a path, and a path may hold "Permission denied".
 ExitStatus statusOf(const PlatformError& error) {
   return error.code == ErrorCode::noAccess ? kNoAccess : kBad;
 }
 
-// Says the error and, where access was refused, what to do about it.
+// Prints the error. A refused access can be mended by the user, so a hint follows it.
 int failWithHint(const PlatformError& error, const char* hint) {
   const ExitStatus status = statusOf(error);
   fail(status, error.words);
@@ -31,6 +32,8 @@ int failWithHint(const PlatformError& error, const char* hint) {
 
 }  // namespace
 
+// A message may quote a path or a word of the command line. terminalText() keeps control characters
+// in them from acting on the terminal.
 int fail(ExitStatus status, const std::string& message) {
   printError("tesselctl: " + terminalText(message) + "\n");
   return status;
@@ -48,7 +51,8 @@ int failToWrite(const PlatformError& error) {
                       "Run tesselctl as root, or as the user that the directory belongs to.\n");
 }
 
-// Refused files come first: that can be mended by another user, a store of too many files cannot.
+// We report refused files first, since another user can read them. A store of too many files stays
+// one for every user. Only one of the two sets the exit status.
 int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string>& store) {
   const auto refused = [](const FileReport& file) { return file.refused; };
   const auto first = std::find_if(report.files.begin(), report.files.end(), refused);
@@ -65,6 +69,8 @@ int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string
       kBad, counted(notLookedAt, "file", "files") + " of the store were one too many and not read");
 }
 
+// The environment is read by the code of the service. A variable that stops the service stops us
+// too, so we never show the figures of another store.
 std::optional<Surroundings> lookAround() {
   auto launch = readLaunchConfiguration(processEnvironment());
   if (const auto* error = std::get_if<LaunchError>(&launch)) {
@@ -100,7 +106,7 @@ void addJudgeOptions(CLI::App& command, ReadingOptions& options) {
 
 CLI::Option* addPatterns(CLI::App& command, const char* name, std::vector<std::string>& patterns,
                          const char* help) {
-  // One word for each --name. With more, the option would swallow the words behind it.
+  // Each --name takes one word. If it took more, it would swallow the words that follow it.
   return command.add_option(name, patterns, help)->allow_extra_args(false)->type_name("PATTERN");
 }
 
@@ -112,7 +118,8 @@ bool fitsOne(const std::vector<std::string>& patterns, const std::string& text) 
 }
 
 std::optional<TesselReporterPlatform> platformNamed(const std::string& name) {
-  // The names are matched exactly, as the service matches them.
+  // We match names exactly, because the service does. A name that we accepted more freely would be
+  // unknown to the service.
   const auto platform = platformFromName(SharedString(name));
   return platform == TesselReporterPlatform::unknown ? std::nullopt : std::optional(platform);
 }
@@ -120,6 +127,7 @@ std::optional<TesselReporterPlatform> platformNamed(const std::string& name) {
 std::optional<Reading> readingOf(const ReadingOptions& options, const Surroundings& surroundings) {
   const LaunchConfiguration& launch = surroundings.launch;
   Reading reading;
+  // An option outranks the environment, and the environment outranks the machine's own journal.
   reading.store = options.store ? options.store : launch.traceStore;
   const PeriodResult period = periodOf(options.period, surroundings.now);
   if (!period.period) {
@@ -135,6 +143,8 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const Surroundin
     }
     reading.machine.platform = *platform;
   }
+  // The file of the operating system is asked last: an option must give the same answer on each
+  // machine, also where the file is missing.
   reading.machine.internal =
       options.internal ||
       (!options.external &&

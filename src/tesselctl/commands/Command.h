@@ -1,5 +1,5 @@
-// What the commands of tesselctl share: how one is added, what it is called with, the options for
-// reading a trace store, and how it ends.
+// The commands of tesselctl share this: a way to add a command, the facts that it starts with, the
+// options for reading a trace store, and the ways to end with an exit status.
 //
 // One thread at a time.
 
@@ -42,13 +42,14 @@ struct Surroundings {
   Date now{};
   Terminal terminal;  // behind standard output
 };
-// Absent where a variable of the environment makes no sense. A line on stderr names it by then.
+// Reads the environment. If a variable makes no sense, prints its name on stderr and returns
+// nothing.
 std::optional<Surroundings> lookAround();
 
 // --- Adding a command.
 
-// Lets a call of `command` run `run` and keep its exit status. `options` live as long as the
-// command; `invocation` must outlive it.
+// Makes `command` call `run` and store its exit status in `invocation`. `command` shares the
+// ownership of `options`. `invocation` must outlive `command`.
 template <typename Options>
 void setAction(CLI::App& command, Invocation& invocation, std::shared_ptr<Options> options,
                int (*run)(const Options&, const Surroundings&)) {
@@ -64,12 +65,13 @@ struct CommandText {
   std::string footer;  // notes and examples below the options
 };
 
-// Adds a subcommand to `app` that runs `run`. Its options are read into what is answered.
+// A subcommand, and the options that the parser fills in. The subcommand owns the options.
 template <typename Options>
 struct AddedCommand {
   CLI::App& command;
   Options& options;
 };
+// Adds a subcommand that calls `run` to `app`. `app` owns it.
 template <typename Options>
 AddedCommand<Options> addCommand(CLI::App& app, Invocation& invocation, const CommandText& text,
                                  int (*run)(const Options&, const Surroundings&)) {
@@ -98,28 +100,29 @@ void addJudgeOptions(CLI::App& command, ReadingOptions& options);
 // Adds an option that takes a pattern and may be repeated.
 CLI::Option* addPatterns(CLI::App& command, const char* name, std::vector<std::string>& patterns,
                          const char* help);
-// Whether `text` fits one of the patterns, which may hold * ? and [...]. It does where there are
-// none.
+// Whether `text` fits one of the patterns. A pattern may hold *, ? and [...]. Without patterns each
+// text fits.
 bool fitsOne(const std::vector<std::string>& patterns, const std::string& text);
 
-// What the options mean. The environment stands in for what is not given.
+// The meaning of the options. The environment supplies the values of options that are not given.
 struct Reading {
   std::optional<std::string> store;  // absent: the machine's own journal
   Period period;
   JudgedMachine machine;
 };
-// Absent where an option makes no sense. A line on stderr names the option and its value by then.
+// If an option makes no sense, prints the option and its value on stderr and returns nothing.
 std::optional<Reading> readingOf(const ReadingOptions& options, const Surroundings& surroundings);
 
-// Reads the period, with a progress bar on standard error. The bar moves from `begin` to `end`,
-// which are parts of 1. `shown` is false where the terminal gets other lines meanwhile.
+// Reads the period and shows a progress bar on standard error. The bar moves from `begin` to `end`,
+// both between 0 and 1. `shown` must be false if other lines go to the terminal meanwhile.
 std::optional<PlatformError> readWithProgress(DryRun& run, const Period& period, bool shown = true,
                                               double begin = 0, double end = 1);
 
-// Absent where no platform is called that.
+// The platform of that name; absent if there is none.
 std::optional<TesselReporterPlatform> platformNamed(const std::string& name);
 
-// --- Ending a command. Each says why on stderr, fit for a terminal, and answers the exit status.
+// --- Ending a command. Each function prints the reason on stderr, fit for a terminal, and returns
+// the exit status.
 
 // "tesselctl: message".
 int fail(ExitStatus status, const std::string& message);
@@ -127,8 +130,8 @@ int fail(ExitStatus status, const std::string& message);
 int failToRead(const PlatformError& error, const std::optional<std::string>& store);
 // A file cannot be written.
 int failToWrite(const PlatformError& error);
-// A store was read, but some files of it were not: whoever trusts the figures must know. kDone
-// where all were read.
+// Warns if some files of a store were not read, since its figures are then too low. Returns kDone
+// and prints nothing if all were read.
 int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string>& store);
 
 // --- The commands, each in a file of its own. `app` and `invocation` live until the program ends.

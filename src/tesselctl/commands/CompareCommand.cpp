@@ -2,7 +2,7 @@
 //
 // Over one period both settings judge the same objects, so we can say for each object what changes.
 // That needs one reading of the store. Over two periods the objects differ and cannot be matched.
-// There we compare trace points: which are reported in one period and not in the other.
+// There we compare trace points instead: we list those that only one period reports.
 
 #include <algorithm>
 #include <map>
@@ -30,8 +30,8 @@ struct Setting {
   Period period;
 };
 
-// Reads "Quarro,internal,last=24h". What a setting does not name is as in `usual`. Absent where a
-// word makes no sense; a line on stderr names it by then.
+// Reads "Quarro,internal,last=24h". A setting takes from `usual` all that it does not name. If a
+// word makes no sense, prints it on stderr and returns nothing.
 std::optional<Setting> settingOf(const std::string& words, const Reading& usual, Date now) {
   Setting setting{usual.machine, usual.period};
   PeriodArguments period;
@@ -56,6 +56,7 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
       return {};
     }
   }
+  // periodOf() would take no arguments for "the last 24 hours" and override --since of the command.
   if (!period.given()) return setting;
   const PeriodResult result = periodOf(period, now);
   if (!result.period) {
@@ -66,13 +67,13 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
   return setting;
 }
 
-// Trace points that one side reports and the other holds back for one reason.
+// A trace point that one side reports and the other does not, with the reason of the other side.
 struct Change {
   bool starts = false;  // reported by the second side alone
   std::string subsystem;
   std::string category;
   std::string name;
-  std::string why;  // verdict of the side that holds back; "not_recorded" if it met none
+  std::string why;  // verdict of the other side; "not_recorded" if it met no such object
   // The text that the whitelist held back: its slot, 1 or 2, and its value. 0 for another reason.
   uint8_t slot = 0;
   std::string value;
@@ -81,8 +82,9 @@ struct Change {
   auto operator<=>(const Change&) const = default;
 };
 
-// Counts of distinct changes. Values of the whitelist may be as many as the objects, so the list is
-// bounded as that of `explain --summary` is. Changes beyond the bound are counted together.
+// Counts of distinct changes. Each object may bring a new value, so the list has the same bound as
+// the list of `explain --summary`. Objects beyond it are counted together, so the listed counts and
+// notListed() add up to starting() and stopping().
 class Changes {
  public:
   static constexpr size_t kMost = 8192;
@@ -119,7 +121,7 @@ class Changes {
 
 std::string textOf(StringRef text) { return std::string(text.textOr("")); }
 
-// What two settings make of a store.
+// The verdicts of both settings on a store, and the changes between them.
 struct Comparison {
   VerdictCounts sides[2] = {};
   Changes changes;
@@ -128,6 +130,7 @@ struct Comparison {
   Losses losses;      // of each reading
 };
 
+// Two periods may read different files, so the losses of both readings are added up.
 void takeReading(const DryRun& run, Comparison& comparison) {
   comparison.store = run.report().store;
   comparison.losses.add(comparison.store.reading.losses);
@@ -142,7 +145,7 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
       ++comparison.sides[side][decisions[side].classification];
     if (decisions[0].shouldReport() == decisions[1].shouldReport()) return true;
     const bool starts = decisions[1].shouldReport();
-    // The reason is told by the side that holds the object back: the other one has none.
+    // Only the side that holds the object back has a reason.
     const FilterDecision& held = decisions[starts ? 0 : 1];
     comparison.changes.add(
         {starts, textOf(object.subsystem()), textOf(object.category()), textOf(object.name()),
@@ -167,6 +170,8 @@ constexpr size_t kMaxPaths = 65536;
 // The verdict that held back most objects.
 std::string mainReason(const VerdictCounts& counts) {
   if (sumOf(counts) == 0) return "not_recorded";
+  // The first verdict is "reported", which is no reason. Among equal counts the first verdict wins,
+  // so the answer does not depend on the order of the store.
   auto main = kVerdictOrder[1];
   for (const auto verdict : kVerdictOrder) {
     if (verdict != TesselReporterClassificationTelemetryReported && counts[verdict] > counts[main])
@@ -175,9 +180,11 @@ std::string mainReason(const VerdictCounts& counts) {
   return std::string(verdictName(main));
 }
 
-// Two periods, each with a judge of its own. A run of the service begins with fresh counters too.
+// Two periods, each with a judge of its own. A judge that went on would have used up caps in the
+// first period, and points of the second would seem to stop.
 void comparePeriods(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
   std::map<Path, PathFigures> paths;
+  // After an error the second reading is skipped: the command fails and shows no figures.
   for (size_t side = 0; side < 2 && !comparison.error; ++side) {
     Judge judge(settings[side].machine);
     DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
@@ -200,7 +207,8 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
   for (const auto& [path, figures] : paths) {
     const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];
     const uint64_t after = figures.sides[1][TesselReporterClassificationTelemetryReported];
-    // More or fewer of them is no change of the setting: traffic differs from day to day.
+    // Traffic differs from day to day. So a change is only a point that was reported in one period
+    // and not once in the other.
     if ((before == 0) == (after == 0)) continue;
     const bool starts = before == 0;
     comparison.changes.add({starts, std::get<0>(path), std::get<1>(path), std::get<2>(path),

@@ -32,7 +32,8 @@ struct EventsOptions {
 // seem immediate to people and cost one short query each.
 constexpr std::chrono::milliseconds kLookForRowsEvery{200};
 
-// A value that says "discarded" where the payload is no JSON. No exception leaves it.
+// The payload as JSON. A payload that is no JSON gives a "discarded" value instead of an exception;
+// a discarded value is no object, so member() finds nothing in it.
 Json parsed(std::string_view payload) { return Json::parse(payload, nullptr, false); }
 
 std::string member(const Json& payload, const char* key) {
@@ -47,9 +48,10 @@ class RowSelection {
 
   bool wants(const SpoolRow& row) const {
     const Date date{std::chrono::microseconds{row.time}};
+    // The end is not in the period, so two periods that touch never share a row.
     if (period_ && (date < period_->start || date >= period_->end)) return false;
     if (!fitsOne(options_.names, std::string(row.name))) return false;
-    // Parsing costs more than all the rest, so it comes last and only where it is needed.
+    // Parsing costs more than all other tests. It comes last, and only if a pattern needs it.
     if (options_.subsystems.empty() && options_.categories.empty()) return true;
     const Json payload = parsed(row.payload);
     return fitsOne(options_.subsystems, member(payload, "Subsystem")) &&
@@ -64,8 +66,9 @@ class RowSelection {
 std::string rowJson(const SpoolRow& row) {
   return objectLine([&](JsonWriter& json) {
     json.member("id", row.id).member("time", row.time).member("name", row.name);
-    // Anybody who may write to the spool may have written this row. A payload that is no JSON must
-    // not break the line that stands around it.
+    // Any writer of the spool may have made this row. A payload that is no JSON would break the
+    // line around it, so it goes out as a text under another key. A script can tell the two by the
+    // key.
     if (Json::accept(row.payload))
       json.rawMember("payload", replaceInvalidUtf8(row.payload));
     else
@@ -92,7 +95,8 @@ std::string glance(const Json& payload, std::string_view text) {
   return out;
 }
 
-// All events of the service share one prefix. Without it the ends, which differ, fit the column.
+// All events of the service share one prefix. Without it the rest of the name, which differs, fits
+// the column.
 std::string shownName(std::string_view name) {
   constexpr std::string_view kCommon = "com.vantor.performance.";
   if (name.starts_with(kCommon)) return "~" + terminalText(name.substr(kCommon.size()));
@@ -105,6 +109,7 @@ std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
   std::string name = shortened(shownName(row.name), kEventWidth);
   name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
   const std::string time = dateText(Date{std::chrono::microseconds{row.time}}).substr(5);
+  // The payload gets the rest of the line, and one column at least on a narrow terminal.
   const size_t used = time.size() + 2 + kEventWidth + 2;
   const std::string payload = cutOff(glance(parsed(row.payload), row.payload),
                                      terminal.width - std::min(used, terminal.width - 1));
@@ -122,6 +127,7 @@ class EventsRun {
 
   int list() {
     const SpoolReader::State state = spool_.open();
+    // A machine that has sent nothing has no spool. With --follow the user waits for just that.
     if (state == SpoolReader::State::absent && options_.follow) {
       printError("There is no spool yet: nothing was sent. Waiting for " +
                  terminalText(spool_.path()) + ".\n");
@@ -150,8 +156,8 @@ class EventsRun {
     }
   }
 
-  // Prints the rows that are new; false where the spool cannot be read. --newest holds for the
-  // first look only: what comes later under --follow is all new.
+  // Prints the rows that are new. Returns false if the spool cannot be read. --newest limits the
+  // first look alone: under --follow each later row is new and must be shown.
   bool show() {
     std::deque<std::string> last;
     const bool limited = options_.newest != 0;
@@ -162,11 +168,14 @@ class EventsRun {
         print(line);
         return true;
       }
+      // The number of rows is not known before the last one is read, so we keep the newest lines
+      // and drop the oldest of them. Memory stays bounded by -n.
       last.push_back(std::move(line));
       if (last.size() > options_.newest) last.pop_front();
       return true;
     });
     for (const std::string& line : last) print(line);
+    // With --follow a reader of the pipe waits for these rows. A buffer would hold them back.
     std::fflush(stdout);
     return read;
   }
@@ -177,7 +186,8 @@ class EventsRun {
       std::this_thread::sleep_for(kLookForRowsEvery);
       const SpoolReader::State state = spool_.open();
       if (state == SpoolReader::State::noAccess) return complain(state);
-      // The service sets a damaged spool aside and makes an absent one, so both pass.
+      // The service sets a damaged spool aside in its next run and then makes a new one. So we wait
+      // for it. A refused access does not mend itself.
       if (state == SpoolReader::State::open) show();
     }
   }
@@ -195,7 +205,7 @@ int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
     const PeriodResult result = periodOf(options.period, surroundings.now);
     if (!result.period) return fail(kUsage, result.error);
     period = result.period;
-    // A period ends now where nothing else is said. What --follow waits for comes later.
+    // Without --until a period ends now. Every row that --follow waits for would lie behind it.
     if (options.follow && options.period.until.empty()) period->end = Date::max();
   }
   return EventsRun(options, period, surroundings).list();

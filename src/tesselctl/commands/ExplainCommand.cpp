@@ -1,8 +1,8 @@
 // explain: what becomes of each recorded trace point, and why.
 //
-// The service's own filter judges here, so the answer cannot differ from that of a run. Every
-// object is judged before the options choose what is shown: the downsampling counters must see all
-// of them.
+// The filter of the service judges here, so we apply the rules of a run. Downsampling counts
+// objects. So we judge every object first, and only then let the options choose which ones are
+// shown.
 
 #include <algorithm>
 #include <memory>
@@ -49,7 +49,7 @@ class PayloadBuilder {
  public:
   PayloadBuilder() : identity_(bundles_), bootVolume_(bootVolumeFacts(volumes_)) {}
 
-  // Empty where nothing would be sent.
+  // Empty if a run would send nothing for the object.
   std::string json(const TesselObject& object) {
     const std::optional<Payload> payload = reportPayload(object, identity_, bootVolume_);
     return payload ? payloadJson(*payload, {.forTerminal = true}) : "";
@@ -67,7 +67,7 @@ struct Explanation {
   const TesselObject& object;
   const EntryHeader& entry;
   const FilterDecision& decision;
-  std::string scope;    // part of the downsampling table that was asked; empty: none was
+  std::string scope;    // the part of the downsampling table that decided; may be empty
   std::string payload;  // JSON; empty where nothing would be sent or --payload is not given
 };
 
@@ -88,7 +88,7 @@ std::string explanationJson(const Explanation& explanation) {
 
 // Columns. A name may be 4,096 bytes long, and one object must not fill the screen.
 constexpr size_t kNameWidth = 60;
-constexpr size_t kVerdictWidth = 18;  // of the longest verdict
+constexpr size_t kVerdictWidth = 18;  // of the longest verdict that a store yields
 constexpr size_t kKindWidth = 9;
 constexpr size_t kFooterWidth = 94;  // as wide as the help text around it
 
@@ -110,7 +110,8 @@ std::string shownKind(const TesselObject& object) {
                                                          : "event";
 }
 
-// The columns of one object: one line, more where its path is long, and one for the reason.
+// The lines for one object: its columns, and below them the reason of the verdict. A long path
+// takes several lines.
 class HumanLines {
  public:
   HumanLines(const Terminal& terminal, const Period& period)
@@ -143,6 +144,8 @@ class HumanLines {
   }
 
  private:
+  // The time, with the day if the period is longer than one day, and a gap of two columns. Within a
+  // day the time alone says which entry is meant.
   size_t timeWidth() const { return withDay_ ? 16 : 10; }
   std::string indented(const std::string& text, size_t indent) const {
     return wrappedBeside(text, terminal_.width, indent) + "\n";

@@ -1,7 +1,7 @@
 // record: writes trace points to the journal, or to an export file for trying things out.
 //
-// A point that a reader would count as malformed is refused here, with a reason. The journal itself
-// takes anything without a word, and the mistake would show a day later, as a number in the books.
+// The journal accepts any point. A mistake would show a day later, as a number in the books of a
+// run. So we refuse each point that a reader would count as malformed, and say why.
 
 #include <spawn.h>
 #include <sys/wait.h>
@@ -41,8 +41,8 @@ constexpr const char* kFooter =
     "the\n"
     "number of the signal that killed it, 127 where it is not found.";
 
-// With --store there is no journal daemon that notes who wrote an entry and when. These options say
-// it in its place; without them it is this process, now.
+// The journal daemon notes who wrote an entry and when. With --store there is no daemon, so these
+// options give the facts. Without them the writer is this process and the time is now.
 struct OriginOptions {
   std::optional<uint64_t> at, monotonic;
   std::optional<double> ago;
@@ -118,19 +118,19 @@ std::optional<Failure> record(const RecordOptions& options, const std::string& k
     error = sendToJournal(list);
     if (error) error->words += " (--store DIR records without a journal)";
   }
-  // Whatever the reason, the store was not reached. Scripts need not tell more apart.
+  // Every error has this status: scripts need only know that the point was not recorded.
   if (error) return Failure{kNoAccess, error->words};
   return std::nullopt;
 }
 
-// As a shell says it: the status of the command, or 128 and the number of the signal.
+// As in a shell: the status of the command, or 128 plus the number of the signal that ended it.
 int exitStatusOf(int waitStatus) {
   return WIFEXITED(waitStatus) ? WEXITSTATUS(waitStatus) : 128 + WTERMSIG(waitStatus);
 }
 
-// Runs the command and answers its exit status. A key on the terminal sends its signal to both of
-// us. The command decides what it means: we ignore it, or the end of the interval would be missing.
-// The command itself must not inherit that, so it gets the defaults back.
+// Runs the command and returns its exit status. A key such as Ctrl-C sends its signal to the
+// command and to us. We ignore it: if we died, nobody would record the end of the interval. The
+// command would inherit the ignored signals, so it gets the defaults back.
 int runCommand(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
   arguments.reserve(command.size() + 1);
@@ -165,8 +165,7 @@ int runCommand(const std::vector<std::string>& command) {
 int recordAround(const RecordOptions& options, const std::vector<std::string>& command) {
   if (const auto failure = record(options, "begin")) return fail(failure->status, failure->message);
   const int status = runCommand(command);
-  // Scripts want the status of the command, which has done its work, even if its end is not
-  // recorded.
+  // The command has done its work. A script wants its status, even if we could not record the end.
   if (const auto failure = record(options, "end")) fail(failure->status, failure->message);
   return status;
 }

@@ -1,4 +1,7 @@
 // report: a page about what was recorded, reported and held back.
+//
+// The page is built in memory and written once the whole store was read. A store that cannot be
+// read therefore leaves the page of yesterday as it is.
 
 #include <unistd.h>
 
@@ -19,18 +22,22 @@ struct ReportOptions {
   bool lastRun = false;
 };
 
+// POSIX does not say that a name which is cut off ends with a NUL. The array starts with zeros and
+// lends one byte less than it has, so the name always ends. A page without a name is still of use,
+// so a failure is no error.
 std::string machineName() {
   std::array<char, 256> name{};
   return ::gethostname(name.data(), name.size() - 1) == 0 ? name.data() : "this machine";
 }
 
 int write(const std::string& path, const std::string& page) {
+  // The web server is another user than the one who runs the report.
   constexpr unsigned kReadableByAll = 0644;
   if (path == "-") {
     print(page);
     return kDone;
   }
-  // A web server may be reading the page of yesterday: it finds the old page or the new one.
+  // A web server may read the page while we replace it. It must never find half a page.
   const auto error = replaceFileDurably(path, page, kReadableByAll);
   return error ? failToWrite(*error) : kDone;
 }
@@ -44,6 +51,8 @@ int makeReport(const ReportOptions& options, const Reading& reading, const Repor
   });
   if (const auto error = readWithProgress(run, reading.period))
     return failToRead(*error, reading.store);
+  // Some files of the store may have been refused. We write the page all the same and only then
+  // warn: its figures are too low but true for the files that were read.
   const int status = write(options.html, htmlReport(tally, run.report(), facts));
   return status == kDone ? warnOfUnreadFiles(run.report().store, reading.store) : status;
 }
@@ -62,6 +71,8 @@ int runReport(const ReportOptions& options, const Surroundings& surroundings) {
     const std::string& directory = surroundings.launch.stateDirectory;
     facts.run = readRunRecord(directory);
     if (!facts.run) return fail(kBad, "no record of a run in " + directory);
+    // A run looks back 24 hours from its start. The same period lets the reader compare the dry run
+    // with the books of the run on one page.
     reading->period = {facts.run->start - std::chrono::hours{24}, facts.run->start};
   }
   return makeReport(options, *reading, facts);

@@ -1,7 +1,8 @@
 // status: does this machine report, and do the books balance?
 //
-// The exit status is for scripts: it is bad only where the reporter itself failed. What the journal
-// lost, or that the machine is not tasked, is shown but is nobody's failure here.
+// Scripts act on the exit status, so it is bad only if the reporter itself failed. The screen also
+// shows entries that the journal lost and a machine that is not tasked. Neither is a failure of the
+// reporter, so neither changes the exit status.
 
 #include <unistd.h>
 
@@ -19,6 +20,8 @@ namespace tessel::ctl {
 
 namespace {
 
+// A run that reported nothing by design stores no rows, not even the one of the summary. Its rows
+// would not balance, so a script finds the two balances only if there are books.
 void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   json.member("start", run.start).member("end", run.end);
   json.member("outcome", runOutcomeName(run.outcome));
@@ -27,7 +30,7 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   addVerdicts(json, run.classified);
   json.member("unnamed", run.unnamed).member("count_events", run.countEvents);
   json.member("rows_stored", run.rowsStored);
-  // Without books no row was expected, though the formula would still say one for the summary.
+  // A run without books stores no row. The formula would still expect the row of the summary.
   json.member("rows_expected", hasBooks ? run.rowsExpected() : 0);
   json.object("rows_failed", [&] {
     for (const auto& [reason, count] : run.rowsFailed) json.member(reason, count);
@@ -40,8 +43,10 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
 }
 
 void writeSpool(JsonWriter& json, const ReporterStatus& status) {
+  // In the order of SpoolReader::State, which indexes them.
   static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
   json.member("state", kStates[static_cast<size_t>(status.spoolState)]);
+  // A spool that we could not read has no figures. Zero rows would pass for an empty spool.
   if (status.spoolState == SpoolReader::State::open) {
     json.member("rows", status.spool.rows).member("bytes", status.spool.bytes);
     json.member("oldest", status.spool.oldest).member("newest", status.spool.newest);
@@ -59,6 +64,8 @@ void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("last_success", counters.lastSuccess);
 }
 
+// A member stands for a fact that exists: without a run there is no "last_run", without a forwarder
+// no "forwarder". Zeros in their place would say that a run counted nothing.
 std::string statusJson(const ReporterStatus& status) {
   return objectLine([&](JsonWriter& json) {
     json.member("good", status.good());
@@ -120,11 +127,12 @@ class Screen {
     std::string left(label);
     left.resize(kLabelWidth, ' ');
     std::string middle(answer);
+    // A long answer pushes its words to the right: without the one space the two would touch.
     middle.resize(std::max(middle.size() + 1, kAnswerWidth), ' ');
     const size_t indent = kLabelWidth + kAnswerWidth;
     out_ += left + terminal_.paint(colour, middle);
     out_ += wrappedBeside(terminalText(words), terminal_.width, indent);
-    // An answer that says it all leaves the column of words empty.
+    // Some answers need no words. The padding of the answer would then end the line with spaces.
     out_.erase(out_.find_last_not_of(' ') + 1);
     out_ += '\n';
   }
@@ -139,6 +147,8 @@ class Screen {
       line("Last run", "none", Colour::plain, "no record of a run in the state directory");
     } else {
       const RunRecord& run = *status_.run;
+      // Only a failed run makes good() false, so only a failed run is red. Every other outcome that
+      // is not complete is a caution.
       const bool bad = run.outcome == RunOutcome::failed;
       const bool well = run.outcome == RunOutcome::completed;
       line("Last run", runOutcomeName(run.outcome),
@@ -152,8 +162,8 @@ class Screen {
       if (status_.hasBooks()) books(run);
       if (run.reading) store(*run.reading, run.logEvents);
     }
-    // The scheduler notes a run after it has ended. The note is newer than the record only where
-    // the run kept none.
+    // The scheduler notes the begin of a run once the run has ended. So a begin after the end of
+    // the recorded run belongs to a later run, and that one left no record.
     if (status_.runWithoutRecord()) {
       more(std::string(status_.run ? "A later run began " : "A run began ") +
            since(*status_.lastBegin) +
@@ -162,6 +172,8 @@ class Screen {
   }
 
   void books(const RunRecord& run) {
+    // We print the whole sum, not only its result. Where the books do not balance, the reader sees
+    // which figure is the wrong one. kVerdictOrder names each verdict once, so the sum is complete.
     std::string sums = grouped(run.inspected) + " inspected of " +
                        counted(run.logEvents, "log event", "log events") + " =";
     std::string plus = " ";
@@ -186,19 +198,23 @@ class Screen {
          balances ? words : "balance: " + words);
   }
 
-  // A caution at most: what the store had lost before the run is no failure of the reporter.
+  // A store may lose entries before the run reads it. The reporter cannot help that, so a loss is a
+  // caution and not a failure.
   void store(const StoreReading& reading, uint64_t entries) {
     std::string words = counted(reading.filesRead, "file", "files") + " and " +
                         counted(entries, "entry", "entries") + " read";
     if (reading.filesOutsideRange != 0)
       words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
     const std::string part = partOfPeriod(reading);
+    // A store may be undamaged and yet too young for the period, so both must hold.
     const bool whole = part.empty() && reading.losses.empty();
     line("Store", whole ? "whole" : "not whole", whole ? Colour::good : Colour::caution, words);
     if (!part.empty()) more(part);
     for (const std::string& loss : lossLines(reading.losses, kLossesOfACode)) more(loss);
   }
 
+  // The file alone does not tell a run at work from one that died. We say both and give the age of
+  // the file, from which a reader can tell.
   void marker() {
     if (!status_.marker.present) {
       line("Marker", "none", Colour::plain, "no run is reporting, and none died");
@@ -210,6 +226,8 @@ class Screen {
              ": a run is reporting, or died; then the next one only removes it");
   }
 
+  // An absent spool is plain, because a machine that was never tasked has none. Only a damaged one
+  // is a failure: a user without access cannot know its state.
   void spool() {
     switch (status_.spoolState) {
       case SpoolReader::State::open:
@@ -227,6 +245,7 @@ class Screen {
     const SpoolContents& spool = status_.spool;
     // Rounded up: a spool with rows in it must not seem to be empty.
     std::string words = grouped((spool.bytes + 1023) / 1024) + " KiB";
+    // An empty spool has no oldest row. If there is an oldest row, there is a newest one.
     if (spool.oldest) {
       words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
                dateText(Date{std::chrono::microseconds{*spool.newest}});
@@ -249,6 +268,8 @@ class Screen {
          trouble ? Colour::caution : Colour::plain, words);
   }
 
+  // A run looks back 24 hours. If the oldest entry is younger, a run misses the time before it
+  // without any sign of damage.
   void journal() {
     if (status_.journal.failure) {
       line("Journal", "unreadable", Colour::bad, status_.journal.failure->words);
@@ -274,12 +295,15 @@ struct StatusOptions {
 
 int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
   const std::string& directory = surroundings.launch.stateDirectory;
-  // Without access every file in it would count as absent, and the screen would look well.
+  // A file that we may not reach looks like a file that is absent. Without this check the screen
+  // would report a healthy machine that never ran.
   if (::access(directory.c_str(), R_OK | X_OK) != 0 && errno == EACCES)
     return failToRead(fileError("state directory " + directory, EACCES), directory);
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
   print(options.json ? statusJson(status) : Screen(status, surroundings.terminal).render());
   std::fflush(stdout);
+  // The screen is printed first: facts that this user may read are worth showing. A refusal
+  // outranks the verdict of good(), since another user may get another answer.
   if (status.journal.failure && status.journal.failure->code == ErrorCode::noAccess)
     return failToRead(*status.journal.failure, status.store);
   if (status.spoolState == SpoolReader::State::noAccess) return kNoAccess;

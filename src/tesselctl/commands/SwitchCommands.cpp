@@ -1,4 +1,7 @@
-// defer and tasking: the two switches of the service, each a file that the service looks for.
+// defer and tasking: the two switches of the service.
+//
+// Each switch is a file that the service looks for. A file needs no running service, so a switch
+// can be set before the service starts and survives a reboot.
 
 #include <unistd.h>
 
@@ -33,6 +36,8 @@ struct Position {
   int (*take)(const SwitchOptions&, const Surroundings&);
 };
 
+// Lets each position share the options of its command. fallthrough() is what lets --json stand
+// behind the position as well: "tasking show --json".
 void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, const char* json,
                std::initializer_list<Position> positions) {
   const auto options = std::make_shared<SwitchOptions>();
@@ -65,9 +70,14 @@ int showDeferral(const SwitchOptions& options, bool wanted, bool changed, const 
 
 int deferOn(const SwitchOptions& options, const Surroundings& surroundings) {
   const std::string file = deferFile(surroundings);
+  // The kernel makes the file only if there is none. So `made` is true for one caller alone, and a
+  // script can trust "changed" to know whether it must switch back. errno is copied at once,
+  // because later calls change it.
   const bool made = createNewFile(file, kReadableByAll);
   const int error = errno;
   if (!made && error != EEXIST) return failToWrite(fileError(file, error));
+  // We make the file all the same. The service may have been started with another environment than
+  // this shell has.
   if (!surroundings.launch.deferOn.file) {
     printError(
         "TESSEL_DEFER_ON does not name \"file\": a service started like this does not look for "
@@ -78,13 +88,16 @@ int deferOn(const SwitchOptions& options, const Surroundings& surroundings) {
 
 int deferOff(const SwitchOptions& options, const Surroundings& surroundings) {
   const std::string file = deferFile(surroundings);
+  // A file that is already gone is the state the caller asked for. "changed" then says false, and
+  // the exit status is good.
   const bool removed = ::unlink(file.c_str()) == 0;
   const int error = errno;
   if (!removed && error != ENOENT) return failToWrite(fileError(file, error));
   return showDeferral(options, false, removed, file);
 }
 
-// The configuration with the new answer. It may hold keys of others, which stay.
+// The configuration with the new answer. Keys of other owners stay. A file that we cannot read or
+// parse is replaced whole, and its other keys are lost: the switch must work even then.
 std::string changedConfiguration(const std::string& file, bool on) {
   const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
   Json configuration = text ? Json::parse(*text, nullptr, false) : Json::object();
@@ -112,13 +125,18 @@ int showTasking(const SwitchOptions& options, const Surroundings& surroundings) 
 int switchTasking(const SwitchOptions& options, const Surroundings& surroundings, bool on) {
   const std::string& directory = surroundings.launch.configurationDirectory;
   std::error_code error;
+  // is_directory() may report an absent directory as an error. create_directories() clears
+  // `error` if it succeeds, so what is left below is a real failure.
   if (!std::filesystem::is_directory(directory, error))
     std::filesystem::create_directories(directory, error);
   if (error) return failToWrite(fileError(directory, error.value()));
-  // The service watches the file and may read it while we write. It finds the old text or the new.
+  // The service watches the file and may read it while we write. Half a text is no JSON and gives
+  // no answer, so the file is replaced in one step.
   const std::string file = taskingFile(surroundings.launch);
   if (const auto failure = replaceFileDurably(file, changedConfiguration(file, on), kReadableByAll))
     return failToWrite(*failure);
+  // We show what the rules of the service now decide, not what was asked for: an internal build
+  // reports even after "off".
   return showTasking(options, surroundings);
 }
 int taskingOn(const SwitchOptions& options, const Surroundings& surroundings) {

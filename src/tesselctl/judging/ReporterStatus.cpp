@@ -1,7 +1,7 @@
 // Gathering what the service left on this machine.
 //
-// Nothing here takes the lock of a run: whoever asks for the status must not delay one. So the
-// facts may come from two moments, when a run ends while we look.
+// A question for the status must not delay a run, so nothing here takes the lock of a run. The
+// price: if a run ends while we look, the facts may come from two moments.
 
 #include "tesselctl/judging/ReporterStatus.h"
 

@@ -36,7 +36,7 @@ struct ReporterStatus {
   std::optional<std::string> deferral;  // why one is wanted
   Marker marker;
   std::optional<RunRecord> run;
-  // When the last run began that came to its end and was not deferred. The scheduler notes it.
+  // The begin of the last run that came to its end and was not deferred. The scheduler notes it.
   std::optional<Date> lastBegin;
   SpoolReader::State spoolState = SpoolReader::State::absent;
   std::string spoolFailure;
@@ -60,7 +60,7 @@ struct ReporterStatus {
   bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
 };
 
-// Reads all of it. What cannot be read is absent, with its reason where there is one.
+// Reads all facts. A fact that cannot be read is absent; its reason is given if there is a place.
 ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now);
 
 }  // namespace tessel::ctl

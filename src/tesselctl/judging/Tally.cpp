@@ -1,8 +1,8 @@
 // Counting what a dry run finds.
 //
-// A day may hold millions of objects, so counting one must cost little: keys are compared as
-// borrowed strings, and a new key alone allocates. What is listed in the end is sorted once, by the
-// caller's demand.
+// A day may hold millions of objects, so counting one must cost little. Keys are compared as
+// borrowed strings, and only a new key allocates. The lists are sorted when a caller asks for them,
+// not while we count.
 
 #include "tesselctl/judging/Tally.h"
 
@@ -29,6 +29,7 @@ microseconds sliceLengthFor(const Period& period) {
   for (const microseconds length : kLengths) {
     if (period.length() / length + 2 <= static_cast<int64_t>(Tally::kMaxSlices)) return length;
   }
+  // A period of many years: whole weeks, rounded up, so that the number of slices stays bounded.
   const microseconds week = hours{7 * 24};
   return (period.length() / (static_cast<int64_t>(Tally::kMaxSlices - 2) * week) + 1) * week;
 }
@@ -76,6 +77,8 @@ void Tally::countPair(const TesselObject& object, TesselReporterClassification c
 }
 
 void Tally::countKind(const TesselObject& object, bool reported) {
+  // An animation interval is an interval as well, so the narrower class is asked first. The numbers
+  // are places in kKinds.
   const size_t kind = object.isKindOf(TesselClass::animationInterval) ? 2
                       : object.isKindOf(TesselClass::interval)        ? 1
                                                                       : 0;
@@ -84,15 +87,17 @@ void Tally::countKind(const TesselObject& object, bool reported) {
 
 void Tally::countSlice(TesselReporterClassification classification, uint64_t realtime) {
   const Date date{microseconds{static_cast<int64_t>(realtime)}};
-  // An interval belongs to the time of its end. Following passes the end of the period.
+  // An interval counts at the time of its end. `explain --follow` reads on after the end of the
+  // period: such an object counts in the sums but has no slice.
   if (date < firstSlice_) return;
   const auto slice = static_cast<size_t>((date - firstSlice_) / sliceLength_);
   if (slice < slices_.size()) ++slices_[slice][classification];
 }
 
 void Tally::countMiss(const TesselObject& object, const FilterDecision& decision) {
-  // Values come from programs and may differ each time. The list is bounded by number and by bytes;
-  // what it cannot take is counted, so that the sums still balance.
+  // Programs choose the values, and each object may bring a new one. Without a bound on number and
+  // bytes one program could fill the memory. We count the objects that the list cannot take, so
+  // listed and unlisted ones still add up to the verdict.
   const decltype(misses_)::Key key{
       {object.subsystem(), object.category(), object.name(), decision.stringValue},
       decision.stringSlot};
@@ -110,6 +115,8 @@ void Tally::countMiss(const TesselObject& object, const FilterDecision& decision
   misses_.add(key) = 1;
 }
 
+// Equal counts are ordered by name. Otherwise the order in which objects arrived would decide, and
+// two reports of one period could differ.
 std::vector<Tally::Pair> Tally::pairs() const {
   std::vector<Pair> pairs;
   for (const auto& [texts, slot, counts] : pairs_.entries())

@@ -1,8 +1,8 @@
 // Tally: the figures of a dry run.
 //
-// Grows with the distinct (subsystem, category) pairs, which the extraction limits, and with the
-// distinct values that the whitelist held back, up to a limit of its own; what is beyond it is
-// counted. Threads: one at a time.
+// Its memory is bounded. The extraction limits the distinct (subsystem, category) pairs. The tally
+// itself limits the distinct values that the whitelist held back; it counts objects with further
+// values together. Threads: one at a time.
 
 #pragma once
 
@@ -31,7 +31,7 @@ class Tally {
   static constexpr size_t kMaxMissBytes = size_t{2} << 20;
   static constexpr size_t kMaxSlices = 48;
 
-  // Trace objects of `period` are counted by slices of it as well.
+  // `period` is divided into slices. Each slice has counts of its own.
   explicit Tally(const Period& period);
 
   void count(const TesselObject& object, const FilterDecision& decision, const EntryHeader& entry);
@@ -41,7 +41,7 @@ class Tally {
     std::string category;
     VerdictCounts counts{};
   };
-  // A value that the whitelist held back, and of which trace point. Absent strings are empty.
+  // A value that the whitelist held back, and its trace point. An absent string is empty here.
   struct Miss {
     std::string subsystem;
     std::string category;

@@ -1,4 +1,7 @@
-// Asking what the gate asks, without its wait.
+// Deciding as the tasking gate of the service does.
+//
+// The gate waits for a configuration to be delivered. A command must answer at once, so we read the
+// file ourselves and leave out the wait.
 
 #include "tesselctl/judging/Tasking.h"
 
@@ -18,8 +21,9 @@ Tasking askTasking(const LaunchConfiguration& launch) {
   const std::string file = taskingFile(launch);
   OsReleaseBuildVariant variant(launch.osReleasePath);
   const TaskingDecision decision = decideTasking(variant, [&]() -> TaskingDecision {
-    // Nothing is delivered for a file that is not there, so the gate would wait in vain.
+    // The service gets no delivery for an absent file. Its gate waits, then decides as we do here.
     if (::access(file.c_str(), F_OK) != 0) return {TaskingReason::noneArrived};
+    // The service has the same limit, so a file too large for it is unusable here, too.
     const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
     const auto configuration = text ? parseConfiguration(*text) : nullptr;
     return taskingDecisionForConfiguration(configuration.get(), kTaskingType);
@@ -28,6 +32,7 @@ Tasking askTasking(const LaunchConfiguration& launch) {
 }
 
 std::string_view taskingSourceName(TaskingSource source) {
+  // In the order of TaskingSource, which indexes them. Scripts compare these words.
   static constexpr std::string_view kNames[] = {"internal_build", "configuration", "absent",
                                                 "unusable"};
   return kNames[static_cast<size_t>(source)];
@@ -44,6 +49,7 @@ std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& laun
     case TaskingSource::unusable:
       break;
   }
+  // The service may read the file as another user. Without this line we would call a good file bad.
   if (::access(tasking.file.c_str(), R_OK) != 0)
     return tasking.file + " may not be read by this user";
   return tasking.file + " does not hold a JSON object with a number or boolean under \"TaskedOn\"";

@@ -28,7 +28,7 @@ constexpr uint64_t kOverlap = 5'000'000;
 // down.
 constexpr uint64_t kProgressMask = 0xfff;
 
-// Passes another stream on and tells a listener how far it is.
+// Passes on the entries of another stream and tells a listener how far it is.
 class WatchedStream final : public EntryStream {
  public:
   WatchedStream(EntryStream& source, TimeRange range, const DryRun::Progress& progress)
@@ -57,7 +57,7 @@ class WatchedStream final : public EntryStream {
 // the same header, so we count them: the third one of a kind is new after a look that saw two.
 class NewEntries {
  public:
-  // From which time on a look must read.
+  // The time from which the next look must read.
   uint64_t start() const { return start_; }
   explicit NewEntries(uint64_t start) : start_(start), latest_(start) {}
 
@@ -170,6 +170,7 @@ std::optional<PlatformError> DryRun::follow(Date start,
       extractor_.processEntries(fresh);
     });
     if (error) return error;
+    // Only a look that succeeded moves the window. Entries of a failed one would be lost.
     news.endLook(microsecondsSince1970(clock.now()));
     afterEachLook();
     std::this_thread::sleep_for(kLookInterval);

@@ -1,10 +1,9 @@
 // DryRun: what a run of the service would make of a trace store, without a run.
 //
-// The store is read, assembled, judged and counted by the service's own parts; nothing is sent, and
-// neither the run marker nor the spool is touched. The downsampling counters begin at zero, as in a
-// process that has just started.
+// The parts of the service read the store and assemble the trace objects. The visitor judges and
+// counts them. Nothing is sent. The run marker and the spool stay as they are.
 //
-// Memory is bounded as that of a run is. Threads: one at a time.
+// Memory has the bounds of a run. Threads: one at a time.
 
 #pragma once
 
@@ -21,23 +20,23 @@ namespace tessel::ctl {
 
 class DryRun {
  public:
-  // Called with each trace object in the order of delivery; the object and `entry`, where it was
-  // recorded, are borrowed. False ends the reading.
+  // Called with each trace object in the order of delivery, and with the journal entry that
+  // completed it. Both are borrowed. The reading ends if it returns false.
   using Visitor = std::function<bool(const TesselObject& object, const EntryHeader& entry)>;
-  // Told how far the reading is, from 0 to 1, and how many entries were read; called every few
-  // thousand entries.
+  // Called every few thousand entries with the part of the period that is read, from 0 to 1, and
+  // the number of entries read.
   using Progress = std::function<void(double part, uint64_t entriesRead)>;
 
   // An absent store is the machine's own journal.
   explicit DryRun(std::optional<std::string> store, Visitor visitor);
 
-  // Reads what the store holds of the period. The error in words.
+  // Reads the entries of the period. Returns an error if the store cannot be opened.
   std::optional<PlatformError> read(const Period& period, const Progress& progress);
-  // Reads on for as long as the visitor answers true: what is recorded from `start` on, soon after
-  // it is. Gives up where the store cannot be opened.
+  // Reads entries from `start` on and waits for new ones until the visitor returns false. Returns
+  // an error if the store cannot be opened.
   std::optional<PlatformError> follow(Date start, const std::function<void()>& afterEachLook);
 
-  // What was found so far; the store's part is that of the last reading.
+  // The findings so far. Its facts about the store are those of the last reading.
   ExtractionReport report() const { return extractor_.report(storeReport_); }
 
  private:

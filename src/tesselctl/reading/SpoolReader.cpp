@@ -1,9 +1,9 @@
 // Reading the spool beside the service.
 //
 // A database with a write-ahead log needs an index file beside it, which even a reader must be able
-// to make. A user who may only read would therefore see nothing. For him we open the database as
-// immutable, which needs no index, but only while there is no log: what stands in a log would be
-// missing without a word.
+// to make. A user who may only read would therefore see nothing. For such a user we open the
+// database as immutable, which needs no index. An immutable database ignores the log, and rows in
+// it would be missing without a word. So we do this only if the log is empty or absent.
 
 #include "tesselctl/reading/SpoolReader.h"
 
@@ -28,7 +28,7 @@ uint64_t sizeOf(const std::string& path) {
   return ::stat(path.c_str(), &facts) == 0 ? static_cast<uint64_t>(facts.st_size) : 0;
 }
 
-// SQLite says "cannot open" where it may not make its files, so that counts as well.
+// SQLite says "cannot open" if it may not make its files, so that code means a refusal as well.
 bool forbids(const SqliteStatus& status) {
   const int code = status.primaryCode();
   return code == SQLITE_CANTOPEN || code == SQLITE_PERM || code == SQLITE_READONLY;
@@ -95,6 +95,8 @@ bool SpoolReader::readNew(const std::function<bool(const SpoolRow&)>& visit) {
       if (step == SqliteStatement::Step::done) return true;
       if (step == SqliteStatement::Step::failed) break;
       const SpoolRow row{rows.integer(0), rows.integer(1), rows.text(2), rows.text(3)};
+      // We note the row before the visitor sees it. A visitor that ends the reading has had this
+      // row, so the next call starts behind it.
       lastId_ = row.id;
       if (!visit(row)) return true;
     }
@@ -112,6 +114,8 @@ std::optional<SpoolContents> SpoolReader::contents() {
   SpoolContents contents;
   contents.rows = *count;
   contents.bytes = sizeOf(path_) + sizeOf(path_ + "-wal");
+  // Rows are in the order of their ids, so the first and the last id give the times without a look
+  // at the rows between.
   if (*count != 0) {
     contents.oldest = database_.integer("SELECT time FROM events ORDER BY id LIMIT 1");
     contents.newest = database_.integer("SELECT time FROM events ORDER BY id DESC LIMIT 1");

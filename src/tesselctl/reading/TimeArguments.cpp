@@ -96,8 +96,8 @@ std::tm midnight(std::tm parts, int dayOffset) {
   return parts;
 }
 
-// Whether summer time is in force at that date is for the zone to say, hence -1: the parts may come
-// from `now`, which may be in the other half of the year.
+// The parts may come from `now`, in the other half of the year, with its flag for summer time. The
+// value -1 lets the C library ask the time zone instead.
 Date fromLocal(std::tm parts) {
   parts.tm_isdst = -1;
   return Date{seconds{std::mktime(&parts)}};
@@ -222,8 +222,8 @@ std::string formatted(Date date, const char* format) {
 
 }  // namespace
 
-// Each part is checked before it is multiplied, the sum after each part: "999999999999w" must be no
-// duration rather than a number that went round.
+// "999999999999w" would overflow and give a wrong duration. So we check each part before we
+// multiply it, and the sum after each part.
 std::optional<microseconds> parseDuration(std::string_view text) {
   Scanner scanner(text);
   microseconds total{0};
@@ -257,8 +257,8 @@ std::optional<Date> parseDate(std::string_view text, Date now) {
 std::string dateText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S"); }
 std::string timeOfDayText(Date date) { return formatted(date, "%H:%M:%S"); }
 
-// Whole units of one or two sizes: who reads how long ago a run was does not want its seconds. Up
-// to two days are said in hours, since "1 days" says too little about a service that runs daily.
+// One or two whole units are enough to tell how long ago a run was. Up to two days are given in
+// hours: the service runs daily, so "1 day" would not say whether a run is overdue.
 std::string durationText(microseconds duration) {
   const auto whole = std::chrono::floor<seconds>(duration).count();
   if (whole < 60) return std::to_string(whole) + " s";

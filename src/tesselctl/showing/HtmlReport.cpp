@@ -1,8 +1,8 @@
 // Writing the report page.
 //
-// The charts are drawn here, as SVG, and not by a script in the page. The page holds what programs
-// recorded, and some of that may be meant to run. A page that may run nothing is safe to open. The
-// price is that a chart only answers the pointer, with the titles of its parts.
+// Programs recorded the texts on the page, and a hostile program may record a script. So the page
+// forbids all scripts, and we draw the charts here, as SVG. The price: a chart cannot be zoomed or
+// filtered. It only shows the title of the part under the pointer.
 
 #include "tesselctl/showing/HtmlReport.h"
 
@@ -30,7 +30,8 @@ Html& Html::at(double value) {
 
 namespace {
 
-// People read the page. Whoever needs every pair and value takes `explain --summary --json`.
+// People read the page, and nobody reads thousands of rows. A program that needs every pair and
+// value takes `explain --summary --json`.
 constexpr size_t kPairsOnPage = 40;
 constexpr size_t kMissesOnPage = 60;
 // Drawings have units of their own and are stretched to the width of the page.
@@ -47,7 +48,7 @@ double ratio(uint64_t part, uint64_t whole) {
   return whole == 0 ? 0 : static_cast<double>(part) / static_cast<double>(whole);
 }
 
-// One object of a million is not none, so something is never shown as "0.0 %".
+// A count that is not zero is never shown as "0.0 %": a reader would take it for none.
 std::string percent(uint64_t part, uint64_t whole) {
   if (whole == 0) return "0 %";
   const double share = ratio(part, whole) * 100;
@@ -56,7 +57,7 @@ std::string percent(uint64_t part, uint64_t whole) {
   return std::to_string(tenths / 10) + "." + std::to_string(tenths % 10) + " %";
 }
 
-// As the heading of a row or column.
+// The words for a verdict, with a capital letter for the heading of a row or column.
 std::string title(TesselReporterClassification verdict) {
   std::string words(classificationRow(verdict).title);
   words[0] = static_cast<char>(std::toupper(words[0]));
@@ -74,7 +75,8 @@ std::string spoken(const VerdictCounts& counts) {
   return words.empty() ? "none" : words;
 }
 
-// A bar of all verdicts, `scale` units wide.
+// A bar of all verdicts, `scale` units wide. The classes are verdict names: the style has a colour
+// for each, which is checked when it is compiled.
 Html bar(const VerdictCounts& counts, double scale) {
   Html html;
   const uint64_t total = sumOf(counts);
@@ -102,6 +104,8 @@ Html legend(const VerdictCounts& counts) {
   return html << "</ul>\n";
 }
 
+// Each tile has an id, and its count stands plain in an attribute. So a program can read the
+// figures although people see them in groups of three digits.
 Html tiles(const Tally& tally, const ExtractionReport& report) {
   const uint64_t objects = tally.traceObjects();
   const uint64_t reported = tally.verdicts()[TesselReporterClassificationTelemetryReported];
@@ -152,6 +156,9 @@ std::string sliceName(const Tally& tally, size_t slice) {
   return wholeDays ? date.substr(0, 10) : date.substr(5, 11);
 }
 
+// A drawing counts y from the top down, so a column starts at the bottom and each part moves up.
+// The gap between columns is 24 % of a step. `top` is at least the highest sum: no column leaves
+// the chart.
 Html columns(const Tally& tally, uint64_t top) {
   Html html;
   const double step = kChartWidth / static_cast<double>(tally.slices().size());
@@ -181,6 +188,7 @@ Html sliceTable(const Tally& tally) {
   for (const auto verdict : kVerdictOrder) html << "<th class=\"n\">" << title(verdict) << "</th>";
   html << "</tr>\n";
   for (size_t slice = 0; slice < tally.slices().size(); ++slice) {
+    // A quiet week would fill the table with rows of zeros.
     if (sumOf(tally.slices()[slice]) == 0) continue;
     html << "<tr><td>" << sliceName(tally, slice) << "</td>";
     for (const auto verdict : kVerdictOrder)
@@ -198,6 +206,7 @@ Html timeSection(const Tally& tally) {
     highest = sumOf(tally.slices()[slice]);
     busiest = slice;
   }
+  // At least 1, since the heights are shares of it.
   const uint64_t top = roundTop(highest);
   Html html;
   html << "<section>\n<h2>Over time</h2>\n<p class=\"soft\">Trace objects; a column is "
@@ -250,6 +259,7 @@ Html pairSection(const Tally& tally) {
 Html missSection(const Tally& tally) {
   const auto misses = tally.misses();
   Html html;
+  // Without a miss the section is left out: its heading alone would look like a fault.
   if (misses.empty()) return html;
   html << "<section>\n<h2>Values that are not known ones</h2>\n<p class=\"soft\">Text values for "
           "which the whitelist "
@@ -307,7 +317,8 @@ Html readingSection(const ExtractionReport& report, const ReportFacts& facts) {
   return html << "</table></div>\n</section>\n";
 }
 
-// Left out where nothing was lost. `id` tells the losses of this reading from those of the run.
+// Losses of one reading; empty if nothing was lost. The page may show two readings, that of the run
+// and ours, so each table has an `id` of its own.
 Html lossSection(const StoreReading& reading, std::string_view title, std::string_view id) {
   Html html;
   const std::string part = partOfPeriod(reading);

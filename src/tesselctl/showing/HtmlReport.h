@@ -1,6 +1,7 @@
 // The report page: the figures of a dry run for people, in one self-contained HTML file.
 //
-// No script, nothing from elsewhere, and a policy in the page that forbids both. Stateless.
+// The page has no script and loads nothing from elsewhere. A policy in the page forbids both.
+// Stateless.
 
 #pragma once
 
@@ -19,7 +20,7 @@ struct ReportFacts {
   std::string platform;
   bool internal = false;
   Date made{};
-  std::optional<RunRecord> run;  // the run whose period this is, where it is one's
+  std::optional<RunRecord> run;  // absent unless the page shows the period of a run
 };
 
 std::string htmlReport(const Tally& tally, const ExtractionReport& report,

@@ -1,7 +1,7 @@
 // Laying out losses.
 //
-// The members of `malformed`, `store`, `files` and `problems` are older than the list of losses.
-// Programs read them, so they are made of the list and stay as they were.
+// Programs read the members `malformed`, `store`, `files` and `problems`. They repeat what `losses`
+// says. We derive them from that list, so the two cannot disagree.
 
 #include "tesselctl/showing/Losses.h"
 
@@ -12,8 +12,8 @@ namespace tessel::ctl {
 
 namespace {
 
-// The losses of one code that are told apart. The "other" one has neither a file nor a unit to
-// name, so it is told as a count of its own.
+// The losses of one code that name a file or a unit. The loss "other" sums up the rest and names
+// neither, so it goes out as a count of its own.
 std::vector<Loss> toldApart(const Losses& losses, LossCode code) {
   std::vector<Loss> found;
   for (const Loss& loss : losses.all()) {
@@ -24,7 +24,7 @@ std::vector<Loss> toldApart(const Losses& losses, LossCode code) {
 
 }  // namespace
 
-// No loss with a count: nobody knows how many entries the journal has already removed.
+// This is no loss with a count: nobody knows how many entries the journal has already removed.
 std::string partOfPeriod(const StoreReading& reading) {
   if (!reading.oldestEntry || reading.reachesRangeStart()) return {};
   const Date oldest{std::chrono::microseconds{static_cast<int64_t>(*reading.oldestEntry)}};
@@ -99,7 +99,7 @@ std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode) {
   const std::vector<Loss>& all = losses.all();
   for (size_t at = 0; at < all.size();) {
     const LossCode code = all[at].code;
-    // What is not shown is what the shown ones leave of the sum, so the lines add up to it.
+    // The rest is the sum less the shown losses, so the lines always add up to the sum.
     uint64_t further = losses.sum(code);
     for (size_t shown = 0; at < all.size() && all[at].code == code; ++at, ++shown) {
       if (shown >= mostOfACode) continue;

@@ -1,7 +1,6 @@
-// What was read of a trace store and what was lost: as JSON and as lines.
+// The reading of a trace store and its losses, as JSON and as lines.
 //
-// The words come with the losses. Here they are laid out and made fit to be shown. Stateless; any
-// thread.
+// Each loss brings its own words. The functions here only lay them out. Stateless; any thread.
 
 #pragma once
 
@@ -14,20 +13,20 @@
 
 namespace tessel::ctl {
 
-// That the store holds only a part of the period, without a full stop; empty where it holds all.
+// A sentence if the store holds only a part of the period, without its full stop; else empty.
 std::string partOfPeriod(const StoreReading& reading);
 
-// `losses`: they are written alike wherever they are shown.
+// Writes the member `losses`. All commands write it alike.
 void addLosses(JsonWriter& json, const Losses& losses);
-// `malformed`: reason to count.
+// Writes the member `malformed`: a count for each reason.
 void addMalformed(JsonWriter& json, const Losses& losses);
-// `beyond_pair_limit`, `without_exe` and `store`.
+// Writes the members `beyond_pair_limit`, `without_exe` and `store`.
 void addStore(JsonWriter& json, const StoreReading& reading);
 // The members of a reading as `status --json` has it.
 void addReading(JsonWriter& json, const StoreReading& reading);
 
-// A line for each loss, but of each code no more than `mostOfACode` and one for the others. The
-// lines are not yet fit for a terminal.
+// One line for each loss. A code gets at most `mostOfACode` lines, and one more for all its other
+// losses. The caller must still make the lines fit for a terminal.
 std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode);
 // All losses under a heading, fit for `terminal`; empty where there is none.
 std::string lossText(const Losses& losses, const Terminal& terminal);

@@ -1,4 +1,8 @@
 // The look of the report page: light and dark, wide and narrow, screen and paper.
+//
+// Colours are named after verdicts, so the page needs no table from verdicts to colours. Bars set
+// `fill` and the keys of a legend set `background`, so each rule sets both. The style stands in the
+// page itself, because the page may load nothing.
 
 #pragma once
 
@@ -99,7 +103,7 @@ footer { font-size: .85rem; padding: .5rem 0; }
 }
 )css";
 
-// How often `text` stands in the style between `before` and `end`.
+// How often `text` occurs in the style directly behind `before` and directly before `end`.
 constexpr size_t timesInStyle(std::string_view before, std::string_view text,
                               std::string_view end) {
   const std::string_view style = kReportStyle;
@@ -110,8 +114,9 @@ constexpr size_t timesInStyle(std::string_view before, std::string_view text,
   }
   return times;
 }
-// A bar without a colour would not be seen, and nobody would miss it. Each classification has a
-// colour in the light, the dark and the printed page, and a rule that uses it.
+// A verdict without a colour would be missing from each chart, and nobody would notice. So each
+// verdict must have a colour in the light, the dark and the printed page, and one rule that uses
+// it.
 static_assert(std::ranges::all_of(kClassifications, [](const ClassificationRow& row) {
   return timesInStyle("--", row.name, ":") == 3 && timesInStyle("\n.", row.name, " {") == 1;
 }));

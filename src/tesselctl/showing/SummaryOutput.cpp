@@ -1,4 +1,7 @@
 // The figures of a dry run as JSON and as tables.
+//
+// JSON is for programs and complete: it lists what the tally lists. Tables are for one screen, so
+// they cut long lists and say how much they cut.
 
 #include "tesselctl/showing/SummaryOutput.h"
 
@@ -11,15 +14,16 @@ namespace tessel::ctl {
 
 namespace {
 
-// Both tables fit on one screen of 50 lines; whoever wants all of them asks for JSON.
+// Both tables together fit on one screen of 50 lines. JSON has all rows.
 constexpr size_t kShownPairs = 20;
 constexpr size_t kShownMisses = 20;
 constexpr size_t kQuotedWidth = 40;  // columns of a value in a sentence
 
-// In tenths of a percent, rounded. A share of nothing is left blank, because a column of "0.0 %"
-// hides the figures that matter.
+// In tenths of a percent, rounded. A share of zero is left blank: many cells of "0.0 %" would hide
+// the figures that matter.
 std::string share(uint64_t part, uint64_t whole) {
   if (whole == 0 || part == 0) return "";
+  // Integers, so that the same counts give the same text on each machine.
   const uint64_t permille = (part * 1000 + whole / 2) / whole;
   return std::to_string(permille / 10) + "." + std::to_string(permille % 10) + " %";
 }
@@ -32,6 +36,7 @@ std::string quoted(StringRef text) {
 std::string whitelistWords(const FilterDecision& decision) {
   const std::string slot = "string " + std::to_string(decision.stringSlot);
   const std::string label = decision.stringLabel ? " " + quoted(decision.stringLabel) : "";
+  // An absent value is held back too, but there is no text to quote.
   if (!decision.stringValue) return slot + label + " has no value";
   return slot + label + " has the value " + quoted(decision.stringValue) +
          (decision.specialRule ? ", which the rule for performance logging does not know"
@@ -40,7 +45,7 @@ std::string whitelistWords(const FilterDecision& decision) {
 
 std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string& scope) {
   std::string words = shortened(terminalText(scope), kQuotedWidth);
-  // A row without a cap lets nothing through; its ratio means nothing then.
+  // A cap of zero lets nothing through, whatever the ratio is. So we do not mention the ratio.
   if (entry.cap() == 0) return words + " is never reported";
   words += ": one in " + grouped(entry.downsampleRatio()) + ", at most " + grouped(entry.cap()) +
            "; this is number " + grouped(entry.eventsSeen()) + ", " +
@@ -48,8 +53,8 @@ std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string&
   return words;
 }
 
-// An absent subsystem is written as an empty text here, where `explain` leaves the key out: each
-// element of an array then has the same keys, which tools for tables want.
+// Tools that make tables want the same keys in each element of an array. So an absent subsystem is
+// an empty text here, while `explain` leaves its key out.
 void writePairs(JsonWriter& json, const Tally& tally) {
   json.array("pairs", tally.pairs(), [&](const Tally::Pair& pair) {
     json.object([&] {
@@ -67,6 +72,7 @@ void writeMisses(JsonWriter& json, const Tally& tally) {
       json.member("value", miss.value).member("count", miss.count);
     });
   });
+  // With this count a script can add up the misses to the verdict `string_whitelist`.
   json.member("whitelist_misses_not_listed", tally.missesNotListed());
 }
 
@@ -74,7 +80,8 @@ void writeFiles(JsonWriter& json, const StoreReport& store) {
   json.array("files", store.files, [&](const FileReport& file) {
     json.object([&] {
       json.member("path", file.path).member("entries_read", file.entriesRead);
-      // A file of other days is skipped, too. Its reason says so, and it is no loss.
+      // A file of other days is skipped as well, which is no loss. A script must read the reason
+      // before it warns.
       json.member("skipped", file.skipped);
       json.array("problems", file.problems.all(), [&](const Loss& problem) {
         json.object([&] {
@@ -112,7 +119,7 @@ std::string verdictTable(const Tally& tally, const Terminal& terminal) {
                {"MEANING", Table::Align::left, true}});
   for (const auto verdict : kVerdictOrder) {
     const uint64_t count = tally.verdicts()[verdict];
-    // No store yields such an object today, so its row would only raise questions.
+    // No store yields such an object today. A row of zero would only raise questions.
     if (count == 0 && verdict == TesselReporterClassificationClassNotSupported) continue;
     table.add(
         {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
@@ -150,8 +157,9 @@ struct PairColumn {
   }
 };
 
-// The columns that are not zero throughout; what is reported is always shown. Every verdict has a
-// column, so the columns of a row sum up to its objects.
+// Every verdict belongs to one column, so the columns of a row add up to its objects. Verdicts that
+// share the column "OTHER" come last. A column of zeros is left out, except REPORTED, which is the
+// figure that people look for.
 std::vector<PairColumn> pairColumns(const VerdictCounts& all) {
   std::vector<PairColumn> columns;
   for (const bool shared : {false, true}) {
@@ -200,15 +208,16 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
                    terminalText(miss.name)});
   }
   std::string out = table.render(terminal, 2) + more(kShownMisses, misses.size(), "values");
-  // The tally is bounded, so a writer of random values cannot fill the memory; JSON lacks them,
-  // too.
+  // The tally keeps a bounded number of values. JSON lacks the others as well, so the line does not
+  // point to it.
   if (tally.missesNotListed() != 0) {
     out += "  " + counted(tally.missesNotListed(), "object", "objects") + " had further values\n";
   }
   return out;
 }
 
-// Begins and ends without a partner are no losses: the partner may be of the day before or after.
+// A begin or an end without a partner is no loss: the partner may stand in the day before or after.
+// Such entries make no object, so this table explains why there are fewer objects than entries.
 std::string unpairedTable(const AssemblyCounts& counts, const Terminal& terminal) {
   Table table({{"ENTRIES", Table::Align::right}, {"WHY NO TRACE OBJECT CAME OF THEM"}});
   const std::pair<uint64_t, const char*> rows[] = {
@@ -291,6 +300,7 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
                     verdictTable(tally, terminal);
   if (tally.traceObjects() != 0)
     out += "\n" + kindTable(tally, terminal) + "\n" + pairTable(tally, terminal);
+  // The verdict decides and not the list: the list may be full while objects were held back.
   if (tally.verdicts()[TesselReporterClassificationFailedStringWhitelist] != 0) {
     out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +
            missTable(tally, terminal);

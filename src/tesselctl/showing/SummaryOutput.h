@@ -1,5 +1,5 @@
-// What a dry run found, as JSON and for people: single verdicts with their reasons, and the
-// summary.
+// The findings of a dry run, as JSON and as text for people: single verdicts with their reasons,
+// and the summary.
 //
 // Stateless; any thread.
 
@@ -17,12 +17,13 @@ namespace tessel::ctl {
 
 Colour verdictColour(TesselReporterClassification classification);
 
-// A count under the name of each verdict.
+// One member for each verdict: its name and its count.
 void addVerdicts(JsonWriter& json, const VerdictCounts& counts);
 
-// The reason of a verdict as the member "rule"; none if the verdict says it all.
+// Writes the reason of a verdict as the member "rule". Writes nothing if the verdict needs no
+// reason.
 void addRule(JsonWriter& json, const FilterDecision& decision, const std::string& scope);
-// The same as a sentence, fit for a terminal; empty if the verdict says it all.
+// The reason as a sentence, fit for a terminal; empty if the verdict needs none.
 std::string ruleWords(const FilterDecision& decision, const std::string& scope);
 
 // The figures as one JSON object on one line.

@@ -22,7 +22,7 @@ namespace {
 // A narrower terminal counts as one of 40 columns: on less, tables would be all ellipses.
 constexpr size_t kNarrowest = 40;
 constexpr size_t kGap = 2;            // between columns
-constexpr size_t kLeastShrunken = 8;  // columns of a text of which both ends still say something
+constexpr size_t kLeastShrunken = 8;  // columns; with fewer, the ends of a text say nothing
 constexpr size_t kBarWidth = 30;
 constexpr std::chrono::seconds kPatience{1};               // before a bar is drawn
 constexpr std::chrono::milliseconds kRedrawInterval{100};  // as often as eyes follow
@@ -74,7 +74,7 @@ std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
   return out;
 }
 
-// $NO_COLOR counts if it holds anything, whatever that is: this is how other programs read it.
+// Other programs take any value of $NO_COLOR for "no", but not an empty one. So do we.
 bool coloursWanted() {
   const char* refused = std::getenv("NO_COLOR");
   if (refused != nullptr && *refused != '\0') return false;
@@ -153,8 +153,9 @@ std::vector<size_t> Table::widths(size_t available) const {
     for (const auto& row : rows_) widest = std::max(widest, displayWidth(row[column].text));
     widths.push_back(widest);
   }
-  // Always the widest column gives way, one column of the terminal at a time: so the wide ones end
-  // up equal and narrow ones are left alone. The row stays too wide if none can give more.
+  // We take one column of the terminal at a time from the widest column of the table. So wide
+  // columns end up equal, and narrow ones keep their width. The row stays too wide if none can give
+  // more.
   const size_t gaps = kGap * (columns_.size() - 1);
   size_t total = std::accumulate(widths.begin(), widths.end(), gaps);
   while (total > available) {
@@ -228,8 +229,8 @@ std::string wrappedBeside(std::string_view text, size_t width, size_t indent) {
   return wrappedBehind(indent, text, std::max(width, indent + 12), indent);
 }
 
-// Whoever reads a pipe may leave early, as `head` does. There is nobody left to complain to, so the
-// process ends at once and without flushing what nobody takes.
+// The reader of a pipe may leave early, as `head` does. Nobody is left to read the rest, so the
+// process ends at once and does not flush its buffer.
 void print(std::string_view text) {
   if (std::fwrite(text.data(), 1, text.size(), stdout) != text.size()) std::_Exit(1);
 }
