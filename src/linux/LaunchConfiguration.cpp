@@ -29,10 +29,16 @@ std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
 }
 
 bool enableSource(DeferSources& sources, std::string_view word) {
-  if (word == "file") return sources.file = true;
-  if (word == "battery") return sources.battery = true;
-  if (word == "pressure") return sources.pressure = true;
+  for (const DeferWord& row : kDeferWords) {
+    if (row.word == word) return sources.*row.source = true;
+  }
   return false;
+}
+
+std::string expectedDeferWords() {
+  std::string words;
+  for (const DeferWord& row : kDeferWords) words.append(words.empty() ? "" : ", ").append(row.word);
+  return "a comma-separated list of these, or nothing: " + words;
 }
 
 std::optional<DeferSources> deferSources(std::string_view list) {
@@ -64,7 +70,7 @@ class VariableReader {
 
   // If the variable is set, gives `target` the value that `parse` makes of it.
   template <typename Target, typename Parse>
-  void read(const std::string& variable, Target& target, const char* expected, Parse parse) {
+  void read(const std::string& variable, Target& target, const std::string& expected, Parse parse) {
     const std::optional<std::string> text = environment_(variable);
     if (!text) return;
     if (auto value = parse(std::string_view(*text))) {
@@ -123,8 +129,7 @@ std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
   variables.read("TESSEL_ACTIVITY_INTERVAL", configuration.activityInterval, kSeconds,
                  wholeSeconds);
   variables.read("TESSEL_DEFER_RETRY", configuration.deferRetry, kSeconds, wholeSeconds);
-  variables.read("TESSEL_DEFER_ON", configuration.deferOn,
-                 "a comma-separated list of file, battery and pressure, or nothing", deferSources);
+  variables.read("TESSEL_DEFER_ON", configuration.deferOn, expectedDeferWords(), deferSources);
   variables.read("TESSEL_LOG", configuration.logDestination, "journal or stderr", logDestination);
   variables.read("TESSEL_LOG_LEVEL", configuration.logLevel, "error or debug", logLevel);
   variables.readPath("TESSEL_OS_RELEASE", configuration.osReleasePath);

@@ -27,6 +27,22 @@ struct DeferSources {
   bool operator==(const DeferSources&) const = default;
 };
 
+// The words of TESSEL_DEFER_ON. A new source is a member, its row here, and its check in
+// DeferralConditions.
+struct DeferWord {
+  std::string_view word;
+  bool DeferSources::*source;
+};
+inline constexpr DeferWord kDeferWords[] = {{"file", &DeferSources::file},
+                                            {"battery", &DeferSources::battery},
+                                            {"pressure", &DeferSources::pressure}};
+
+constexpr DeferSources allDeferSources() {
+  DeferSources all;
+  for (const DeferWord& row : kDeferWords) all.*row.source = true;
+  return all;
+}
+
 enum class LogDestination { journal, standardError };
 
 struct LaunchConfiguration {
@@ -35,7 +51,7 @@ struct LaunchConfiguration {
   std::string configurationDirectory = "/etc/tessel";
   std::optional<std::chrono::seconds> activityInterval;  // absent: one run, then the process ends
   std::chrono::seconds deferRetry{900};
-  DeferSources deferOn{true, true, true};
+  DeferSources deferOn = allDeferSources();
   std::optional<LogDestination> logDestination;  // absent: the journal where there is one
   LogLevel logLevel = LogLevel::error;
   std::string osReleasePath = "/etc/os-release";
