@@ -1,4 +1,4 @@
-// Sorting the tokens of an entry into slots, pairing begins with ends, and making the objects.
+// Sorts the tokens of an entry into slots, pairs begins with ends, and makes the objects.
 
 #include "trace/IntervalAssembler.h"
 
@@ -12,14 +12,15 @@ FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
   return tokens[static_cast<size_t>(kind)];
 }
 
-// The rows of the journal fields and the slots of the objects have the same labelled arguments.
+// labelled() counts kinds two by two, so FieldKind must have a label and a value for each labelled
+// argument of an object.
 static_assert(labelled(FieldKind::string1Name, kLabelledStrings) == FieldKind::number1Name &&
               labelled(FieldKind::number1Name, kLabelledNumbers) == FieldKind::duration);
 
 }  // namespace
 
-// The counts are kept as plain numbers and put in words only at the end, because most stores hold
-// millions of entries.
+// A store may hold millions of entries. So we count in plain numbers while we read, and put them
+// into words only at the end.
 void addLosses(const AssemblyCounts& counts, Losses& losses) {
   losses.add(LossCode::noImagePath, "process gone before _EXE was read", {},
              counts.withoutImagePath);
@@ -42,8 +43,8 @@ AssemblyCounts IntervalAssembler::counts() const {
   return counts;
 }
 
-// The reader collects the tokens of an entry just before this call and those of the next one after
-// it. So at its end nobody holds a token but the open intervals, and the table may be emptied.
+// The reader collects the tokens of one entry before this call, and those of the next entry after
+// it. So when take() is done, only the open intervals hold tokens, and we may empty the table.
 void IntervalAssembler::consume(const Entry& entry) {
   take(entry);
   if (table_.full()) [[unlikely]]
@@ -58,8 +59,8 @@ void IntervalAssembler::take(const Entry& entry) {
     return;
   }
   ++counts_.tracePoints;
-  // The daemon looks up _EXE after it received the entry. A process that is gone by then leaves
-  // none, and without it nobody can say which program the object is from.
+  // The daemon looks up _EXE after it received the entry. If the process has ended by then, the
+  // entry has no _EXE, and nobody can say which program the object came from.
   if (point_[FieldKind::imagePath] == kNoToken) ++counts_.withoutImagePath;
   switch (table_.pointKind(point_[FieldKind::pointKind])) {
     case PointKind::event:
@@ -71,8 +72,8 @@ void IntervalAssembler::take(const Entry& entry) {
   }
 }
 
-// An entry with one of the required fields, good or bad, means to be a trace point: where the
-// others are missing that is counted. Any other entry of the journal is none of our business.
+// An entry that has at least one required field, good or bad, means to be a trace point. If it
+// lacks another, it counts as malformed. All other entries are ordinary log messages.
 bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens) const {
   return std::any_of(tokens.begin(), tokens.end(), [this](FieldToken token) {
     const FieldKind kind = TracePointTable::kind(token);
@@ -80,8 +81,8 @@ bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens)
   });
 }
 
-// Where a field occurs more than once, its last value counts. The buffers are kept from entry to
-// entry, so that most entries allocate nothing.
+// If an entry has a field more than once, the last value counts. All entries share the buffers of
+// point_, so most entries allocate nothing.
 void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   point_.tokens.fill(kNoToken);
   point_.attributes.clear();
@@ -98,7 +99,8 @@ void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   }
 }
 
-// An entry with several faults is counted under one reason, so that the reasons add up to entries.
+// An entry with several faults counts under one reason only. So the sum over all reasons is the
+// number of malformed entries.
 std::optional<MalformedReason> IntervalAssembler::fault() const {
   if (point_.malformed != kNoToken) return table_.malformedReason(point_.malformed);
   for (size_t slot = 0; slot < kRequiredFields; ++slot) {
@@ -132,9 +134,9 @@ void IntervalAssembler::end(const EntryHeader& header) {
     return;
   }
   ++counts_.pairedEnds;
-  // `begin` stays valid up to close(): a sink sees objects alone and cannot open an interval.
-  // An end that claims an earlier time than its begin gets a negative duration. The filter counts
-  // those; to leave them out here would hide them.
+  // The pointer stays valid until close(), because a sink cannot reach `open_`. If the end has an
+  // earlier time than its begin, the interval gets a negative duration. We deliver it all the same,
+  // because the filter counts such intervals.
   const auto microseconds = static_cast<int64_t>(header.monotonic - begin->monotonic);
   const auto seconds = static_cast<float>(static_cast<double>(microseconds) / 1e6);
   if (sink_.admits(table_.text(begin->key.subsystem), table_.text(begin->key.category))) {
@@ -143,8 +145,9 @@ void IntervalAssembler::end(const EntryHeader& header) {
   open_.close(begin);
 }
 
-// Where both ends state a field, the end counts, because it knew how things went. Only telemetry is
-// on when either end says so: a writer marks an interval at one end. Each end keeps its process.
+// If begin and end state the same field, the end's value counts, because the writer knew more by
+// then. Telemetry is different: a writer may mark an interval at either side, so one mark is
+// enough. The object names the process of the begin and the process of the end.
 void IntervalAssembler::deliverMerged(const PointTokens& begin,
                                       const std::vector<FieldToken>& beginAttributes,
                                       float measuredSeconds) {
@@ -168,9 +171,9 @@ void IntervalAssembler::deliverMerged(const PointTokens& begin,
   }
 }
 
-// Ends of two boots never match, because the monotonic time starts anew with each boot and the
-// distance between the two would mean nothing. Ends of two processes match in system scope alone,
-// because two processes may well use the same ids.
+// The monotonic clock starts anew with each boot, so a difference between two boots means nothing.
+// That is why the key holds the boot. Two processes may use the same id by chance. That is why the
+// key holds the process, unless the writer asked for system scope.
 IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
   const bool system = table_.flag(point_[FieldKind::scope]);
   return {table_.identity(point_[FieldKind::intervalId]),
@@ -181,8 +184,8 @@ IntervalKey IntervalAssembler::keyOf(const EntryHeader& header) {
           system ? IntervalKey::kSystemScope : point_[FieldKind::process]};
 }
 
-// A duration that the writer states counts before the measured one: it may time something else than
-// the moments at which it wrote.
+// A writer may time something else than the moments at which it writes. So a duration that it
+// states counts, and the measured one is only the fallback.
 TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
                                              float measuredSeconds) const {
   const auto text = [&](FieldKind kind) { return table_.text(tokenOf(tokens, kind)); };
@@ -211,8 +214,8 @@ EmittingProcess IntervalAssembler::processOf(const PointTokens& tokens) const {
           table_.text(tokenOf(tokens, FieldKind::processName))};
 }
 
-// Adds the attributes whose key is not there yet. Keys are interned in one pool, so equal keys have
-// one record. Comparing each with all others is quick enough for the 32 that an entry may have.
+// Adds the attributes whose key the interval does not have yet. All keys come from one pool, so
+// equal keys have the same record. An entry has at most 32 attributes, so a linear search is quick.
 void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
                                          IntervalFields& interval) const {
   for (const FieldToken token : tokens) {
@@ -224,8 +227,8 @@ void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
   }
 }
 
-// The key of an interval consists of tokens, so it changes with them. Two keys that differ stay
-// different, because equal values have equal tokens in the new generation too.
+// A key consists of tokens, so each key changes with the generation. Different values get different
+// tokens in the new generation too, so two different keys never become equal.
 void IntervalAssembler::startGeneration() {
   TracePointTable::Renewal renewal = table_.startGeneration();
   open_.renewAll([&](OpenInterval& interval) {

@@ -1,12 +1,13 @@
-// IntervalAssembler: from the tokens of entries to trace objects.
+// IntervalAssembler makes trace objects from the tokens of journal entries.
 //
-// An event is delivered when it is read, an interval when its end is read. A begin and an end match
-// when boot, subsystem, category, name and id are equal, and in process scope the process too. A
-// second begin under the same key replaces the first. An end without a begin is counted. A field
-// that the end lacks is taken from the begin; telemetry is on when either says so. An interval with
-// a frame rate on either end is an animation interval.
+// It delivers an event when it reads the entry, and an interval when it reads the interval's end. A
+// begin and an end match if boot, subsystem, category, name and id are equal. In process scope the
+// process must be equal too. A second begin with the same key replaces the first. An end without a
+// begin is counted and delivers nothing. If the end lacks a field, the interval takes it from the
+// begin. Telemetry is on if the begin or the end says so. An interval is an animation interval if
+// its begin or its end has a frame rate.
 //
-// Nothing here looks at text. Pairing compares tokens, and objects borrow interned strings.
+// This class compares tokens and never reads text. The objects borrow the strings of the table.
 //
 // Threads: one at a time.
 
@@ -23,11 +24,11 @@
 
 namespace tessel {
 
-// Where assembled objects go.
+// Receives the assembled objects.
 class TraceObjectSink {
  public:
   virtual ~TraceObjectSink() = default;
-  // Whether an object of this subsystem and category is to be made at all.
+  // Whether the assembler shall make an object of this subsystem and category.
   virtual bool admits(StringRef subsystem, StringRef category) = 0;
   virtual void deliverEvent(std::shared_ptr<const TesselEvent> event) = 0;
   virtual void deliverInterval(std::shared_ptr<const TesselInterval> interval) = 0;
@@ -38,28 +39,29 @@ class TraceObjectSink {
 struct AssemblyCounts {
   uint64_t tracePoints = 0;  // well-formed entries: events, begins, ends
   uint64_t events = 0;
-  uint64_t pairedEnds = 0;  // ends that met their begin
+  uint64_t pairedEnds = 0;  // ends that matched an open begin
   std::array<uint64_t, kMalformedReasons> malformed{};
-  uint64_t withoutImagePath = 0;      // trace points without _EXE
-  uint64_t unmatchedEnds = 0;         // ends whose begin was not read
+  uint64_t withoutImagePath = 0;      // trace points without a usable _EXE
+  uint64_t unmatchedEnds = 0;         // ends that matched no open begin
   uint64_t replacedBegins = 0;        // begins that a second one with the same key replaced
-  uint64_t droppedOpenIntervals = 0;  // open intervals beyond the limits
+  uint64_t droppedOpenIntervals = 0;  // begins that OpenIntervals dropped for lack of room
   uint64_t openIntervals = 0;         // begins that still wait for their end
 };
 
-// Adds those of them that are losses. Begins and ends that found no partner are none: the partner
-// may be of the day before or after.
+// Adds the counts that stand for losses. A begin or an end without a partner is no loss, because
+// the partner may lie in the day before or after.
 void addLosses(const AssemblyCounts& counts, Losses& losses);
 
 class IntervalAssembler {
  public:
-  // REQUIRES: table and sink outlive the assembler, and nobody else keeps tokens of the table.
+  // REQUIRES: table and sink outlive the assembler. Nobody else keeps tokens of the table from one
+  // consume() to the next.
   IntervalAssembler(TracePointTable& table, TraceObjectSink& sink, OpenIntervalLimits limits = {});
   IntervalAssembler(const IntervalAssembler&) = delete;
   IntervalAssembler& operator=(const IntervalAssembler&) = delete;
 
-  // Takes in one entry. Afterwards its tokens are no longer good: where the table is full, it
-  // starts a new generation.
+  // Takes in one entry. The caller must not use the entry's tokens afterwards, because a full table
+  // starts a new generation here.
   void consume(const Entry& entry);
   AssemblyCounts counts() const;
 

@@ -13,18 +13,19 @@ namespace tessel {
 
 namespace {
 
-// Reading so many entries takes milliseconds. That is often enough for any watchdog and seldom
-// enough to cost nothing.
+// The reader takes a few milliseconds for this many entries. The watchdog waits minutes, and one
+// call in 4,096 entries does not show in the time of a run.
 constexpr uint64_t kEntriesPerStep = 4096;
 
-// Dates before 1970 are before every entry.
+// No entry is older than 1970, so an earlier date means the same as 1970.
 uint64_t microsecondsSince1970(Date date) {
   return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
 }
 
-// The books of the run. Every trace point is an event, a begin or an end. A begin met its end, was
-// replaced, was dropped or still waits; an end met its begin or did not. Every event and every pair
-// was delivered, or refused because of the limit on pairs. A summary over other books would lie.
+// The books of the run must balance, or the summary of the run would be wrong. Every trace point is
+// an event, a begin or an end. A begin met its end, was replaced, was dropped or still waits. An
+// end met its begin or did not. Every event and every matched end made an object, which was
+// delivered or refused by the limit on pairs.
 void checkBooks(const ExtractionReport& report) {
   const AssemblyCounts& counts = report.assembly;
   const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
@@ -35,8 +36,8 @@ void checkBooks(const ExtractionReport& report) {
   TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + refused);
 }
 
-// At the end of the reading and once for each loss: a line for each damaged entry would fill the
-// journal that is being read.
+// We log at the end of the reading, one line for each loss of the list. A line for each damaged
+// entry would fill the very journal that we read.
 void logLosses(const Losses& losses) {
   if (!tesselReporterLog().isEnabled(LogLevel::debug)) return;
   for (const Loss& loss : losses.all()) {
@@ -52,7 +53,7 @@ bool PairLimit::admits(StringRef subsystem, StringRef category) {
   // texts, and pairs whose texts change places, apart.
   const auto hash = static_cast<uint32_t>(pair.subsystem + pair.category * 0x9e3779b97f4a7c15u);
   const auto isPair = [&](uint32_t number) { return pairs_[number] == pair; };
-  // Nearly every object has a pair that was let in long ago.
+  // Nearly every object has a pair that was admitted before.
   if (index_.find(hash, isPair) != FlatIndex::kNone) return true;
   const size_t text = subsystem.textOr("").size() + category.textOr("").size();
   if (pairs_.size() >= limits_.pairs || textBytes_ + text > limits_.textBytes) {
@@ -85,7 +86,7 @@ void JournalExtractor::setEmitEventProcessingBlock(EventCallback callback) {
   event_ = std::move(callback);
 }
 
-// No data is handed over with the flag, so its store needs no order with others.
+// The flag hands over no other data, so a relaxed store is enough.
 void JournalExtractor::stopProcessing() { stop_.store(true, std::memory_order_relaxed); }
 
 bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string>& path,
@@ -108,8 +109,8 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
   return true;
 }
 
-// The flag is looked at before each entry and never within one, so an entry that was begun has all
-// its consequences and the books balance at whatever place a stop ends the loop.
+// The loop looks at the stop flag between two entries only. So it finishes each entry that it
+// began, and the books balance wherever a stop ends it.
 void JournalExtractor::processEntries(EntryStream& entries) {
   while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
     if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
@@ -121,8 +122,8 @@ void JournalExtractor::processEntries(EntryStream& entries) {
   report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);
 }
 
-// The losses of the store and those of its entries are kept apart until somebody asks, because a
-// store may be read again while the assembler counts on.
+// A caller may go on processing after a report, and the counts of the assembler grow. So report_
+// keeps only the losses of the store, and each report adds the others to its own copy.
 ExtractionReport JournalExtractor::report(const StoreReport& store) const {
   ExtractionReport report = report_;
   report.assembly = assembler_.counts();
@@ -144,7 +145,7 @@ bool JournalExtractor::admits(StringRef subsystem, StringRef category) {
   return pairs_.admits(subsystem, category);
 }
 
-// Counted before the call: a callback that answers false has had its object too.
+// We count before the call, because a callback that answers false did receive its object.
 template <typename Callback, typename Object>
 void JournalExtractor::deliver(const Callback& callback, const Object& object) {
   ++report_.delivered;

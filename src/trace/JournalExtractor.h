@@ -1,15 +1,14 @@
-// JournalExtractor: the trace-extraction service over a trace store.
+// JournalExtractor reads a trace store and delivers its trace objects to callbacks.
 //
-// It stands on top of this folder. TracePointFields says which journal fields a trace point has.
+// It is the top of this folder. TracePointFields says which journal fields a trace point has.
 // TracePointTable turns each FIELD=value of a store into a token. OpenIntervals keeps the begins
-// that wait, IntervalAssembler pairs them with their ends and makes the objects, and this class
-// reads the store and delivers them.
+// that wait for their end. IntervalAssembler pairs begins with ends and makes the objects.
 //
-// It reads the store once, entry by entry on the calling thread, and calls back in between. A
-// callback that answers false ends the processing call as a stop does. An extractor that was
-// stopped stays stopped.
+// A processing call reads the store entry by entry and runs the callbacks on the calling thread. A
+// callback that answers false ends the call, as stopProcessing() does. After either, further
+// processing calls read nothing.
 //
-// Threads: stopProcessing() may come from any thread at any time; everything else belongs to the
+// Threads: any thread may call stopProcessing() at any time. All other functions belong to the
 // thread of the run.
 
 #pragma once
@@ -28,22 +27,22 @@
 
 namespace tessel {
 
-// What a run does for each (subsystem, category) pair at its end takes time and memory, and a
-// writer may make up as many pairs as it likes. 4,096 is more than a machine full of programs has;
-// 4 MiB of text give each of them names of 1 KiB.
+// At its end a run spends time and memory on each (subsystem, category) pair, and a writer may make
+// up any number of pairs. So there is a limit. A machine full of programs has fewer than 4,096
+// pairs. 4 MiB of text leave 1 KiB for the names of each.
 struct PairLimits {
   size_t pairs = 4096;
   size_t textBytes = size_t{4} * 1024 * 1024;  // of all subsystems and categories together
 };
 
-// Lets in so many distinct pairs and refuses the others. A pair is known by its two seeded 64-bit
-// hashes, so that no text is kept; that two pairs ever meet in both is out of reach of any writer.
+// Admits distinct pairs up to the limits and refuses all further ones. To save memory it keeps two
+// 64-bit hashes of a pair and no text. The hashes are seeded, so a writer cannot make up two pairs
+// that share both.
 class PairLimit {
  public:
   explicit PairLimit(PairLimits limits = {}) : limits_(limits) {}
 
-  // Whether the pair is among those that were let in, or there is room to let it in. Counts each
-  // refusal.
+  // True if the pair was admitted before or if there is room for it now. Counts each refusal.
   bool admits(StringRef subsystem, StringRef category);
   size_t pairs() const { return pairs_.size(); }
   uint64_t refusals() const { return refusals_; }
@@ -57,7 +56,7 @@ class PairLimit {
   };
 
   const PairLimits limits_;
-  std::vector<Pair> pairs_;  // those that were let in
+  std::vector<Pair> pairs_;  // the admitted pairs
   FlatIndex index_;          // of pairs_
   size_t textBytes_ = 0;
   uint64_t refusals_ = 0;
@@ -69,28 +68,30 @@ struct ExtractionLimits {
   PairLimits pairs;
 };
 
-// What the processing calls found, beside what they delivered.
+// The books of all processing calls so far.
 struct ExtractionReport {
-  uint64_t entriesRead = 0;  // trace points or not
+  uint64_t entriesRead = 0;  // all entries, also ordinary log messages
   AssemblyCounts assembly;
   uint64_t delivered = 0;  // objects handed to a callback
-  uint64_t pairs = 0;      // distinct (subsystem, category) among them
+  uint64_t pairs = 0;      // distinct (subsystem, category) that were admitted
   bool stopped = false;    // by stopProcessing() or a callback that answered false
-  StoreReport store;       // its losses include those of entries that were read
+  StoreReport store;       // its losses also cover the trace points of `assembly`
 };
 
 class JournalExtractor final : public TesselSupportObjectExtractor, private TraceObjectSink {
  public:
-  // `systemStore` is where the system's own trace store is; absent, it is the machine's journal.
+  // `systemStore` is the path of the system's own trace store. If it is absent, the extractor reads
+  // the machine's journal.
   explicit JournalExtractor(std::optional<std::string> systemStore = std::nullopt,
                             const ExtractionLimits& limits = {});
-  // Tells `status`, which must outlive the extractor, every few thousand entries that it gets on.
+  // Reports progress to `status` every few thousand entries. REQUIRES: `status` outlives the
+  // extractor.
   void reportProgressTo(ServiceStatus& status) { status_ = &status; }
 
   void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;
   void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
   void setEmitEventProcessingBlock(EventCallback callback) override;
-  // This extractor builds no composite timelines, so either answer changes nothing.
+  // This extractor builds no composite timelines, so the setting has no effect.
   void setBuildAnimationCompositeIntervalTimelines(bool) override {}
   bool processLogArchiveWithPath(const std::optional<std::string>& path, Date startDate,
                                  Date endDate, std::optional<PlatformError>& errorOut) override;
@@ -98,18 +99,19 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   uint64_t processedEventCount() const override { return report_.entriesRead; }
   std::optional<StoreReading> reading() const override;
 
-  // Delivers what `entries` holds until it ends or a stop takes effect. May be called again, with
-  // the same stream after it grew or with another: intervals that are open stay open in between.
+  // Delivers the objects of `entries` until the stream ends or a stop takes effect. The caller may
+  // call again, with another stream or with the same one after it grew. Open intervals stay open
+  // from one call to the next.
   // REQUIRES: the stream was made with tokenizer() and stopFlag().
   void processEntries(EntryStream& entries);
   FieldTokenizer& tokenizer() { return table_; }
   const StopFlag& stopFlag() const { return stop_; }
 
-  // Where the entry stands that the object of the running callback came from; an interval comes
-  // from its end. REQUIRES: a callback is running.
+  // The header of the entry that completed the object of the running callback. For an interval that
+  // is its end. REQUIRES: a callback is running.
   const EntryHeader& currentEntry() const { return *current_; }
-  // About what was processed so far. The store's part is there after the processing call; who
-  // reads a store of his own hands in what that one reports.
+  // The books so far. processLogArchiveWithPath() fills in the store's part when it ends. A caller
+  // of processEntries() reads a store of its own and passes that store's report.
   ExtractionReport report() const { return report(report_.store); }
   ExtractionReport report(const StoreReport& store) const;
 
@@ -133,7 +135,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   EventCallback event_;
   ServiceStatus* status_ = nullptr;
 
-  const EntryHeader* current_ = nullptr;  // while an entry is looked at
+  const EntryHeader* current_ = nullptr;  // the entry that was read last
   ExtractionReport report_;
 };
 

@@ -1,4 +1,4 @@
-// The slab of begins, their list by age, and the bounds.
+// The slab of begins, their list by age, and the limits.
 
 #include "trace/OpenIntervals.h"
 
@@ -12,8 +12,8 @@ namespace {
 
 constexpr uint64_t pairOf(uint32_t high, uint32_t low) { return (uint64_t{high} << 32) | low; }
 
-// Seeded, because a writer chooses the order in which tokens are given out and so could choose keys
-// that all land in one place.
+// A writer chooses the order of the tokens, so it could choose keys that all fall into one place of
+// the index and make each search slow. A seeded hash prevents that.
 uint32_t hashOf(const IntervalKey& key) {
   return hashWords(pairOf(key.boot, key.subsystem), pairOf(key.category, key.name), key.id,
                    uint64_t{key.process});
@@ -32,8 +32,8 @@ const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
   return number == kNone ? nullptr : &nodes_[number];
 }
 
-// The interval that is replaced goes before the new one comes: the new one then stands at the young
-// end of the list, and the attributes of the old one do not count against it.
+// The replaced interval leaves before the new one enters. So the new one becomes the youngest, and
+// the attributes of the old one use up none of the limit.
 bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
                          const std::vector<FieldToken>& attributes) {
   const uint32_t hash = hashOf(key);
@@ -49,8 +49,8 @@ bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const Point
   node.hash = hash;
   link(number);
   index_.add(hash, number);
-  // The last interval stays whatever it carries. An entry has at most 32 attributes, so only a
-  // limit below that, as tests set it, could ask for more.
+  // We never drop the interval that was just opened. One entry has at most 32 attributes, so only a
+  // limit below 32, as a test may set, can be exceeded by a single interval.
   while (size_ > limits_.intervals || (attributes_ > limits_.attributes && size_ > 1)) {
     remove(oldest_);
     ++dropped_;
@@ -58,13 +58,13 @@ bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const Point
   return replaced != kNone;
 }
 
-// The place in the slab is the number, so closing needs no second search by key.
+// The place of a node in the slab is its number, so close() needs no second search by key.
 void OpenIntervals::close(const OpenInterval* interval) {
   remove(static_cast<uint32_t>(static_cast<const Node*>(interval) - nodes_.data()));
 }
 
-// Free nodes are used first, so the slab never has more nodes than intervals were open at once. The
-// free ones are a list through `older`, which takes no memory of its own.
+// We use free nodes first, so the slab has no more nodes than were ever needed at once. The free
+// nodes are linked through `older`, so their list takes no memory of its own.
 uint32_t OpenIntervals::newNode() {
   if (free_ == kNone) {
     nodes_.emplace_back();
@@ -84,8 +84,8 @@ void OpenIntervals::link(uint32_t number) {
 void OpenIntervals::remove(uint32_t number) {
   index_.erase(nodes_[number].hash, number);
   release(number);
-  // Every open interval stands in the list by age and in the index. One that is only in the list
-  // would never meet its end, and one that is only in the index would never be dropped.
+  // Every open interval is both in the list by age and in the index. An interval that is missing in
+  // the index would never meet its end. One that is missing in the list would never be dropped.
   TESSEL_INVARIANT(index_.size() == size_);
 }
 
@@ -99,8 +99,8 @@ void OpenIntervals::release(uint32_t number) {
   --size_;
 }
 
-// The hash of a key comes from its tokens, so the index is made anew. It goes from the youngest to
-// the oldest, because those that find no room are to be the oldest, as with the other limits.
+// New tokens give each key a new hash, so we build the index anew. We start with the youngest
+// interval: if there is no room for all, the oldest must go, as with the limits.
 void OpenIntervals::renewAll(const std::function<bool(OpenInterval&)>& renew) {
   index_.clear();
   uint32_t at = youngest_;

@@ -1,12 +1,12 @@
-// OpenIntervals: the begins that wait for their end.
+// OpenIntervals keeps the begins that wait for their end.
 //
-// The begins stand in a slab, an index finds them by their key, and a list links them by age: over
-// the limits the oldest goes, because the end that is longest overdue is the least likely to come.
-// A begin that replaces another counts as the youngest, for the same reason: its end is due from
-// now on. The memory is that of as many begins as were ever open at once.
+// The begins lie in a slab. An index finds them by key, and a list links them by age. If there are
+// too many, the oldest is dropped, because the longest overdue end is the least likely to come. A
+// begin that replaces another becomes the youngest, because its own end is not overdue yet. The
+// slab never shrinks: it has room for as many begins as were ever open at once.
 //
-// Intervals hold tokens, from one entry to the next and over a change of generation: see
-// renewAll().
+// An interval keeps its tokens while other entries are read. When the table starts a new
+// generation, renewAll() exchanges them.
 //
 // Threads: one at a time.
 
@@ -26,12 +26,13 @@ namespace tessel {
 
 using PointTokens = std::array<FieldToken, kPointSlots>;
 
-// A begin and an end belong together where these are equal.
+// A begin and an end belong together if their keys are equal.
 struct IntervalKey {
-  // Stands for the process of an interval whose ends may come from two. No token has this value.
+  // Takes the place of the process if begin and end may come from two processes. No token has this
+  // value.
   static constexpr FieldToken kSystemScope = ~FieldToken{0};
 
-  uint64_t id;  // TracePointTable::identity() of its token
+  uint64_t id;  // TracePointTable::identity() of the id's token
   FieldToken boot;
   FieldToken subsystem;
   FieldToken category;
@@ -48,9 +49,9 @@ struct OpenInterval {
   std::vector<FieldToken> attributes;
 };
 
-// A writer that begins intervals and never ends them must not take our memory. 65,536 begins of 160
-// bytes are 10 MiB, far more than a machine has under way at once. An attribute is a token of 4
-// bytes, so 262,144 of them are 1 MiB: room for four on each of that many begins.
+// A writer that never ends its intervals must not use up our memory. No ordinary machine has 65,536
+// intervals open at once; at 160 bytes a begin they take 10 MiB. An attribute is a token of 4
+// bytes, so 262,144 attributes take 1 MiB. That is four attributes for each begin.
 struct OpenIntervalLimits {
   size_t intervals = 65'536;
   size_t attributes = 262'144;  // of all open intervals together
@@ -60,7 +61,7 @@ class OpenIntervals {
  public:
   explicit OpenIntervals(OpenIntervalLimits limits = {});
 
-  // Opens an interval. Answers whether one was open under the same key, which it replaces.
+  // Opens an interval. If one is open under the same key, replaces it and answers true.
   bool open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
             const std::vector<FieldToken>& attributes);
   // The open interval under `key`, or null; valid until the next call that is not const.
@@ -68,19 +69,19 @@ class OpenIntervals {
   // REQUIRES: `interval` was answered by find().
   void close(const OpenInterval* interval);
 
-  // Calls `renew`, which may change the key, on each interval from the youngest to the oldest. The
-  // first for which it answers false is dropped, and so are all that are older.
+  // Calls `renew` on each interval, from the youngest to the oldest. `renew` may change the key.
+  // When it first answers false, that interval and all older ones are dropped.
   void renewAll(const std::function<bool(OpenInterval&)>& renew);
 
   size_t size() const { return size_; }
-  // How many were dropped because of the limits, or because they found no room when renewed.
+  // The number of begins dropped by the limits or by renewAll().
   uint64_t dropped() const { return dropped_; }
 
  private:
   static constexpr uint32_t kNone = FlatIndex::kNone;
   struct Node : OpenInterval {
     uint32_t hash = 0;       // of the key
-    uint32_t older = kNone;  // of a free node: the next free one
+    uint32_t older = kNone;  // in a free node: the next free node
     uint32_t younger = kNone;
   };
 
@@ -96,7 +97,7 @@ class OpenIntervals {
   uint32_t free_ = kNone;
   uint32_t oldest_ = kNone;
   uint32_t youngest_ = kNone;
-  size_t size_ = 0;  // of the list by age
+  size_t size_ = 0;  // nodes in the list by age
   size_t attributes_ = 0;
   uint64_t dropped_ = 0;
 };

@@ -1,4 +1,4 @@
-// Looking a field up by its name, and decimal numbers.
+// Looks up fields by name and parses decimal numbers.
 
 #include "trace/TracePointFields.h"
 
@@ -26,8 +26,8 @@ std::optional<double> parseFinite(std::string_view text) {
 
 }  // namespace
 
-// An export file asks this about every field of every entry, and most fields are no trace point's.
-// The prefix tells that before any name is compared.
+// The reader of export files calls this for every field of every entry, and most of these fields do
+// not belong to a trace point. The check of the prefix saves comparing their names with all rows.
 const JournalField* journalFieldNamed(std::string_view name) {
   if (!name.starts_with('_') && !name.starts_with("TESSEL_")) return nullptr;
   const auto* field = std::ranges::find(kJournalFields, name, &JournalField::name);
@@ -43,7 +43,7 @@ std::optional<Number> parseDecimal(std::string_view text) {
 
 std::optional<float> parseFloat(std::string_view text) {
   const auto real = parseFinite(text);
-  // The cast of a double that no float can hold is undefined.
+  // The cast below is undefined for a double outside the range of a float.
   if (!real || std::fabs(*real) > double{std::numeric_limits<float>::max()}) return std::nullopt;
   return static_cast<float>(*real);
 }

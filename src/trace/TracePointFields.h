@@ -1,10 +1,10 @@
-// The journal fields of a trace point: one row for each says what it is called, which values it may
-// have, and what is wrong with an entry that lacks it or has a bad one. Whoever reads or writes
-// trace points takes that from here.
+// The journal fields of a trace point. The table has one row for each field: its name, the values
+// that it may have, and the reason to count if it is bad or missing. The reader of trace points and
+// `tesselctl record` both use this table.
 //
-// A new field is a kind and a row here, and its use in IntervalAssembler.cpp.
+// To add a field, add a kind and a row here, and use it in IntervalAssembler.cpp.
 //
-// Any thread.
+// Constants and pure functions, for any thread.
 
 #pragma once
 
@@ -22,8 +22,8 @@
 
 namespace tessel {
 
-// What a token can stand for. The kinds below `attribute` stand at most once in a trace point and
-// have a slot in it. Required ones come first, so that one comparison tells them.
+// What a token can stand for. A trace point has one slot for each kind before `attribute`. The
+// required kinds come first, so that isRequired() is one comparison.
 enum class FieldKind : uint8_t {
   pointKind,
   subsystem,
@@ -32,7 +32,7 @@ enum class FieldKind : uint8_t {
   intervalId,
   scope,
   telemetry,
-  // Of the labelled arguments: label, value, label, value, as labelled() counts.
+  // The labelled arguments. Label and value alternate, because labelled() counts that way.
   string1Name,
   string1Value,
   string2Name,
@@ -47,28 +47,32 @@ enum class FieldKind : uint8_t {
   processName,
   process,
   attribute,
-  // No journal fields: a bad value of any field, and the boot that the entry's header names.
+  // These two are no journal fields. `malformed` stands for a bad value of any field, `boot` for
+  // the boot that the header of an entry names.
   malformed,
   boot,
 };
 inline constexpr size_t kPointSlots = static_cast<size_t>(FieldKind::attribute);
 
-// The kind that `ofFirst`, such as string1Value, has for the labelled argument of another index.
+// The kind of a later labelled argument. `ofFirst` is the kind of the first, and the first has
+// index 0: labelled(string1Value, 1) is string2Value.
 constexpr FieldKind labelled(FieldKind ofFirst, size_t index) {
   return static_cast<FieldKind>(static_cast<size_t>(ofFirst) + 2 * index);
 }
 
-// In the order of the words.
+// In the order of kPointKindWords.
 enum class PointKind : uint8_t { event, begin, end };
 inline constexpr std::string_view kPointKindWords[] = {"event", "begin", "end"};
-// The second is the one that pairs across processes.
+// "system" pairs a begin and an end of two processes. Its index is not 0, so
+// TracePointTable::flag() is true for it.
 inline constexpr std::string_view kScopeWords[] = {"process", "system"};
 
-// Attributes that one entry may carry. An interval compares each with all others, so their number
-// bounds the time that one entry can take.
+// The most attributes of one entry. An interval compares each attribute with all others, so this
+// limit bounds the time that one entry can take.
 inline constexpr size_t kMaxAttributes = 32;
 
-// Why an entry that means to be a trace point is not taken as one. Reports list them in this order.
+// Why an entry with fields of a trace point counts as malformed. Reports list the reasons in this
+// order.
 enum class MalformedReason : uint8_t {
   unknownKind,
   unknownScope,
@@ -95,7 +99,7 @@ inline constexpr std::string_view kMalformedReasonTexts[] = {
 };
 inline constexpr size_t kMalformedReasons = std::size(kMalformedReasonTexts);
 static_assert(kMalformedReasons == static_cast<size_t>(MalformedReason::missingCategory) + 1);
-static_assert(kMaxFieldValueLength == 4096 && kMaxAttributes == 32);  // as the texts say
+static_assert(kMaxFieldValueLength == 4096 && kMaxAttributes == 32);  // the texts name both
 
 constexpr std::string_view malformedReasonText(MalformedReason reason) {
   return kMalformedReasonTexts[static_cast<size_t>(reason)];
@@ -118,7 +122,7 @@ struct JournalField {
   std::string_view name;
   ValueForm form = ValueForm::text;
   std::optional<MalformedReason> whenBad = {};
-  std::optional<MalformedReason> whenMissing = {};  // set: no trace point goes without the field
+  std::optional<MalformedReason> whenMissing = {};  // set if each trace point must have the field
   std::span<const std::string_view> words = {};
 };
 
@@ -166,21 +170,22 @@ static_assert(std::ranges::all_of(kJournalFields, [](const JournalField& field) 
 constexpr const JournalField& journalField(FieldKind kind) {
   return kJournalFields[static_cast<size_t>(kind)];
 }
-// The field called `name`; null for a field that no trace point has.
+// The field called `name`. Null if trace points have no such field.
 const JournalField* journalFieldNamed(std::string_view name);
 
-// Whether every trace point has a field of this kind.
+// The number of fields that every trace point must have. The second assertion says that their rows
+// come first, which isRequired() relies on.
 inline constexpr size_t kRequiredFields =
     std::ranges::count_if(kJournalFields, [](const auto& field) { return !!field.whenMissing; });
 static_assert(std::ranges::is_partitioned(kJournalFields,
                                           [](const auto& field) { return !!field.whenMissing; }));
 constexpr bool isRequired(FieldKind kind) { return static_cast<size_t>(kind) < kRequiredFields; }
 
-// An integer that fits 64 bits stays one, signed where it fits both; another finite decimal is a
-// double. Nothing for any other text, such as one with a space or a plus sign.
+// An integer becomes an int64_t, or a uint64_t if it is too large for that. Any other finite
+// decimal becomes a double. Absent for all other texts, such as one with a space or a plus sign.
 std::optional<Number> parseDecimal(std::string_view text);
 
-// A finite decimal within the range of a 32-bit float.
+// Absent if `text` is no finite decimal or is outside the range of a 32-bit float.
 std::optional<float> parseFloat(std::string_view text);
 
 }  // namespace tessel

@@ -1,4 +1,4 @@
-// Parsing of single fields, and the generations of the table.
+// Parses single fields and starts the generations of the table.
 
 #include "trace/TracePointTable.h"
 
@@ -11,8 +11,9 @@ namespace tessel {
 
 namespace {
 
-// Room for the values of one entry beyond the limit, which is looked at between entries only. An
-// entry with more makes the table move, which costs time and nothing else.
+// The assembler checks the limit between two entries, so one entry may exceed it. This is room for
+// the values of such an entry. An entry with more values makes the vector move, which only costs
+// time.
 constexpr size_t kRoomForOneEntry = 4096;
 
 }  // namespace
@@ -22,9 +23,10 @@ TracePointTable::TracePointTable(TracePointTableLimits limits)
 
 TracePointTable::Contents TracePointTable::emptyContents(const TracePointTableLimits& limits) {
   Contents contents;
-  // Room for all at once: pages that are never touched cost nothing, and nothing is ever moved.
+  // We reserve everything at once, so the vector need not move. Pages that nobody touches cost
+  // nothing.
   contents.fields.reserve(limits.fields + kRoomForOneEntry);
-  contents.fields.emplace_back();  // what kNoToken stands for: no text, no number, identity 0
+  contents.fields.emplace_back();  // the value of kNoToken: no text, no number, identity 0
   return contents;
 }
 
@@ -41,8 +43,8 @@ FieldToken TracePointTable::malformedToken(FieldKind kind, MalformedReason reaso
   return addOnce(wholeField(FieldKind::malformed, static_cast<uint64_t>(reason) | required));
 }
 
-// Nearly every trace point has all required fields. So a reader need only follow the list of
-// entries of the first; the others are its companions.
+// Nearly every trace point has all required fields. So the reader follows only the first field's
+// list of entries, and uses the other fields to check that this list is enough.
 std::vector<EntryMark> TracePointTable::marks() const {
   EntryMark mark{kJournalFields[0].name};
   for (size_t i = 1; i < kRequiredFields; ++i) mark.companions.push_back(kJournalFields[i].name);
@@ -57,8 +59,8 @@ FieldToken TracePointTable::tokenFor(std::string_view name, std::string_view val
   const JournalField* field = journalFieldNamed(name);
   if (field == nullptr) return kNoToken;
   if (size <= kMaxFieldValueLength) return parse(*field, value);
-  // The daemon adds the fields with an underscore, so what is wrong with one is no fault of the
-  // writer's, and the trace point goes without it.
+  // The daemon adds the fields that begin with an underscore. If such a value is too long, the
+  // writer is not to blame, so the trace point counts without the field.
   return name.starts_with('_') ? kNoToken
                                : malformedToken(field->kind, MalformedReason::valueTooLong);
 }
@@ -97,8 +99,8 @@ FieldToken TracePointTable::parse(const JournalField& field, std::string_view va
   return malformedToken(kind, *field.whenBad);
 }
 
-// Most numbers stand in one entry alone, so they are not looked for among those that are there.
-// Processes are, because pairing compares their tokens.
+// Most numbers occur in one entry only, so we add them without a search for an equal one. Process
+// numbers need the search, because pairing compares their tokens.
 FieldToken TracePointTable::parseNumber(const JournalField& field, std::string_view value) {
   const std::optional<Number> number = parseDecimal(value);
   if (!number) return kNoToken;
@@ -115,10 +117,11 @@ FieldToken TracePointTable::parseNumber(const JournalField& field, std::string_v
   return field.form == ValueForm::process ? addOnce(parsed) : add(parsed);
 }
 
-// Most ids are numbers that only a begin and its end have, so interning their texts would fill the
-// pool for nothing. A number n is stored as 2n + 1. The identity of a text is the address of its
-// record, which is even, so the two never meet. A number in another spelling, such as "07", is a
-// text: it is another id than "7". With 18 digits, 2n + 1 still fits 64 bits.
+// Most ids are numbers that only one begin and one end have. To intern their texts would fill the
+// pool for nothing, so we store a number n as 2n + 1. The identity of a text is the address of its
+// record, which is even, so a number and a text never have the same identity. The ids "07" and "7"
+// must stay different, so a number with a leading zero is stored as a text. 18 digits are the limit
+// because 2n + 1 must fit 64 bits.
 FieldToken TracePointTable::parseIdentifier(FieldKind kind, std::string_view value) {
   constexpr size_t kMostDigits = 18;
   uint64_t number = 0;
@@ -129,16 +132,17 @@ FieldToken TracePointTable::parseIdentifier(FieldKind kind, std::string_view val
   return usual ? add(wholeField(kind, number * 2 + 1)) : textToken(kind, value);
 }
 
-// A second showing of the same attribute is added again, because attributes are compared by
-// their keys and never by their tokens.
+// We add an attribute each time without a search for an equal one, because the assembler compares
+// attributes by key and never by token.
 FieldToken TracePointTable::addAttribute(std::string_view key, std::string_view value) {
   contents_.attributes.emplace_back(contents_.strings->intern(key),
                                     contents_.strings->intern(value));
   return add(wholeField(FieldKind::attribute, contents_.attributes.size() - 1));
 }
 
-// The pool looks the text up anyway, so the token of the first kind of field that has it stands as
-// a note beside the string. Few texts have a second kind; those are found through the index.
+// The pool must look up the text anyway. So it keeps a note beside each string: the token of the
+// first kind of field that had this text. Few texts occur in fields of a second kind; the index
+// finds the tokens of those.
 FieldToken TracePointTable::textToken(FieldKind kind, std::string_view value) {
   const auto [string, note] = contents_.strings->internNoted(value);
   if (note != kNoToken && TracePointTable::kind(note) == kind) return note;
@@ -152,11 +156,12 @@ FieldToken TracePointTable::textToken(FieldKind kind, std::string_view value) {
 FieldToken TracePointTable::add(const Field& field) {
   contents_.fields.push_back(field);
   const size_t index = contents_.fields.size() - 1;
-  TESSEL_INVARIANT(index >> kIndexBits == 0);  // or two values would share a token
+  TESSEL_INVARIANT(index >> kIndexBits == 0);  // otherwise two values would share a token
   return static_cast<FieldToken>(field.kind) << kIndexBits | static_cast<FieldToken>(index);
 }
 
-// The form is compared too: the signed -1 and the greatest unsigned number have the same bits.
+// We compare the form too, because the signed -1 and the greatest unsigned number have the same
+// bits.
 FieldToken TracePointTable::addOnce(const Field& field) {
   const uint32_t hash = hashWords(field.identity(), static_cast<uint64_t>(field.kind));
   const auto isField = [&](FieldToken token) {
@@ -166,8 +171,8 @@ FieldToken TracePointTable::addOnce(const Field& field) {
   return contents_.index.findOrAdd(hash, isField, [&] { return add(field); });
 }
 
-// The 16 bytes of a boot's id are interned like a text, so that pairing compares boots by token
-// too. Entry after entry has the same boot, so the last one is compared before anything is hashed.
+// We intern the 16 bytes of a boot id like a text, so that pairing can compare boots by token. Most
+// entries have the boot of the entry before, so we compare with that one before we hash.
 FieldToken TracePointTable::bootToken(const Id128& boot) {
   if (lastBootToken_ != kNoToken && boot == lastBoot_) return lastBootToken_;
   lastBoot_ = boot;
@@ -197,20 +202,21 @@ MalformedReason TracePointTable::malformedReason(FieldToken token) const {
   return static_cast<MalformedReason>(at(token).whole & ~kMalformedRequired);
 }
 
-// Readers notice by the number. That it starts at 0 again after four thousand million generations
-// does no harm: a reader compares it with the one before.
+// Readers see by the number that their cached tokens are invalid. The number wraps around after
+// four thousand million generations. That does no harm, because a reader compares it with the last
+// one.
 TracePointTable::Renewal TracePointTable::startGeneration() {
   ++generation_;
   lastBootToken_ = kNoToken;
   return {*this, std::exchange(contents_, emptyContents(limits_))};
 }
 
-// Many intervals hold the same token. The first exchange leaves the new token in the old table, so
-// that a value is interned again only once.
+// Many intervals hold the same token. The first exchange stores the new token in the old table, so
+// each value is added to the new table only once.
 FieldToken TracePointTable::Renewal::renewed(FieldToken old) {
   if (old == kNoToken) return kNoToken;
   Field& field = old_.fields[indexOf(old)];
-  // A token of an earlier generation would stand for another value here.
+  // A token of an even earlier generation would stand for another value here.
   TESSEL_INVARIANT(field.kind == kind(old));
   if (field.form != Form::forwarded) {
     field.whole = addAgain(field);
@@ -225,7 +231,7 @@ FieldToken TracePointTable::Renewal::addAgain(const Field& old) {
     const auto& [key, value] = old_.attributes[old.whole];
     return table_.addAttribute(key.text(), value.text());
   }
-  // Numbers and identifiers go in without a search, as they did when they were first read.
+  // We add numbers and numeric ids without a search, as parse() does.
   const ValueForm form = journalField(old.kind).form;
   const bool once =
       form == ValueForm::word || form == ValueForm::flag || form == ValueForm::process;

@@ -1,17 +1,17 @@
 // TracePointTable: parses and interns each distinct FIELD=value of the store once.
 //
-// Its answer is a token: token = kind << 24 | index into the table. Equal values of a string, a
-// process or a boot have equal tokens, and equal ids of intervals have equal identities, so whoever
-// pairs or counts compares integers.
+// It gives out tokens: token = kind << 24 | index into the table. Equal strings, processes and
+// boots have equal tokens within one kind, and equal interval ids have equal identities. So pairing
+// compares integers.
 //
-// A day may hold more distinct values than fit into memory. A table that is full() is therefore
-// emptied, which starts a new generation of tokens and a new pool of strings. Its one user does
-// that between two entries, when nobody but itself holds a token, and exchanges the tokens that it
-// holds. Objects that were delivered hold no tokens; they keep the old pool of strings alive. The
-// alternative, to throw out single values that were not used for long, was discarded: it would
-// need a count of users for every value, and a reader would have to ask about every token.
+// A day may hold more distinct values than fit into memory. So IntervalAssembler, the only user,
+// empties a full table between two entries. That starts a new generation of tokens and a new pool
+// of strings. At that moment only the open intervals hold tokens, and the user exchanges them for
+// new ones. Delivered objects hold no tokens; they keep the old pool of strings alive. We discarded
+// the alternative of removing single values that were not used for long. It would need a count of
+// users for every value, and readers would have to check every token.
 //
-// Threads: one at a time. The strings may be read from any thread by whoever keeps the pool.
+// Threads: one at a time. A thread that keeps the pool may read its strings at any time.
 
 #pragma once
 
@@ -26,9 +26,9 @@
 
 namespace tessel {
 
-// 512 Ki values of 16 bytes are 8 MiB, and 6 MiB hold the texts of about as many: the strings of an
-// ordinary day fit several times over. While a generation is replaced, the old one and at most half
-// of a new one are in memory together, so the whole stays near 20 MiB.
+// 512 Ki values of 16 bytes take 8 MiB, and their texts may take 6 MiB. The strings of an ordinary
+// day fit several times over. While a new generation replaces the old one, the old one and at most
+// half of the new one are in memory. So both together stay near 20 MiB.
 struct TracePointTableLimits {
   size_t fields = size_t{512} * 1024;          // distinct values; at most 15 million
   size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
@@ -45,8 +45,8 @@ class TracePointTable final : public FieldTokenizer {
 
   FieldToken bootToken(const Id128& boot);
 
-  // The functions from here on answer the value of a token of this generation. A token is only good
-  // for those that suit its kind; kNoToken is good for all, and its value is absent.
+  // These functions answer the value of a token. REQUIRES: the token is of this generation, and the
+  // function suits its kind. kNoToken suits all but attribute(); its value is absent.
   static FieldKind kind(FieldToken token) { return FieldKind(token >> kIndexBits); }
   // Equal for equal values of one kind; 0 for an absent value.
   uint64_t identity(FieldToken token) const { return at(token).identity(); }
@@ -54,25 +54,25 @@ class TracePointTable final : public FieldTokenizer {
   std::optional<Number> number(FieldToken token) const;
   float real(FieldToken token) const { return at(token).real; }
   PointKind pointKind(FieldToken token) const;
-  // Of the telemetry flag; of a scope, whether it is "system".
+  // For the telemetry field: whether it is on. For a scope: whether it is "system".
   bool flag(FieldToken token) const { return at(token).whole != 0; }
   MalformedReason malformedReason(FieldToken token) const;
-  // Whether the bad field is one that every trace point has.
+  // Whether the bad field is a required one.
   bool malformedIsRequired(FieldToken token) const {
     return (at(token).whole & kMalformedRequired) != 0;
   }
-  // Key and value. REQUIRES: the token is not kNoToken.
+  // The key and the value. REQUIRES: the token is not kNoToken.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {
     return contents_.attributes[at(token).whole];
   }
   // Keeps every string of this generation alive.
   std::shared_ptr<const StringPool> strings() const { return contents_.strings; }
 
-  // Whether the table is over its limits, and a new generation is due before the next entry.
+  // Whether the table is over its limits. If so, a new generation is due before the next entry.
   bool full() const { return holds(1); }
   class Renewal;
-  // Empties the table. REQUIRES: no token of an entry is in use. Every token is void after the
-  // call; one that is to be kept is exchanged through the answer.
+  // Empties the table, so that every token becomes invalid. The caller exchanges the tokens that it
+  // keeps through the answer. REQUIRES: the tokens of the current entry are no longer in use.
   Renewal startGeneration();
 
  private:
@@ -80,14 +80,14 @@ class TracePointTable final : public FieldTokenizer {
   struct Field {
     union {
       const StringRecord* record = nullptr;
-      uint64_t whole;  // of a signed number: its two's complement; forwarded: the new token
+      uint64_t whole;  // a signed number in two's complement; if forwarded, the new token
       double fraction;
       float real;
     };
     FieldKind kind = FieldKind::malformed;
     Form form = Form::none;
 
-    // Two equal texts have one record, so its address stands for the text.
+    // The pool keeps one record for equal texts, so the address of the record identifies the text.
     uint64_t identity() const {
       return form == Form::text ? reinterpret_cast<uintptr_t>(record) : whole;
     }
@@ -96,14 +96,15 @@ class TracePointTable final : public FieldTokenizer {
     std::shared_ptr<StringPool> strings = std::make_shared<StringPool>();
     std::vector<Field> fields;
     std::vector<std::pair<StringRef, StringRef>> attributes;
-    FlatIndex index;  // of the tokens of fields that are found again by value
+    FlatIndex index;  // finds a token by the value of its field
   };
 
-  // A malformed value is its reason, with this bit where the bad field is a required one.
+  // The value of a malformed token is the reason. This bit is added if the bad field is required.
   static constexpr uint64_t kMalformedRequired = 0x100;
   static_assert(kMalformedReasons <= kMalformedRequired);
-  // 24 bits number 16 million values, 32 times the limit. That leaves 8 bits for the kind, of which
-  // the highest is 0: the tokens with that bit belong to the store itself.
+  // 24 bits can number 16 million values, which is 32 times the default limit. The other 8 bits
+  // hold the kind. Its highest bit is always 0, because tokens with that bit set belong to the
+  // store.
   static constexpr int kIndexBits = 24;
   static_assert(FieldToken(FieldKind::boot) < kFirstReservedToken >> kIndexBits);
 
@@ -119,7 +120,7 @@ class TracePointTable final : public FieldTokenizer {
   FieldToken textToken(FieldKind kind, std::string_view value);
   FieldToken add(const Field& field);
   FieldToken addOnce(const Field& field);
-  // Whether the table holds more than its limits divided by `share`.
+  // Whether the table holds more than 1/`share` of one of its limits.
   bool holds(size_t share) const {
     return contents_.fields.size() + contents_.attributes.size() > limits_.fields / share ||
            contents_.strings->memoryUsed() > limits_.textBytes / share;
@@ -132,14 +133,14 @@ class TracePointTable final : public FieldTokenizer {
   FieldToken lastBootToken_ = kNoToken;
 };
 
-// A generation that was just started, together with the values of the one before. REQUIRES: the
-// table outlives it, and no entry is read while it lives.
+// Carries tokens over from the old generation to the one that was just started. REQUIRES: the table
+// outlives the renewal, and nobody reads an entry while the renewal lives.
 class TracePointTable::Renewal {
  public:
-  // The token of the new generation for one of the old.
+  // The new token for the value of an old token.
   FieldToken renewed(FieldToken old);
-  // Whether more may be kept. What is kept fills at most half of the table, or the next generation
-  // would be due at once.
+  // Whether there is room to keep more. We fill only half of the table with kept values, because a
+  // table that is nearly full would need the next generation at once.
   bool hasRoom() const { return !table_.holds(2); }
 
  private:
