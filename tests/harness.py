@@ -200,13 +200,21 @@ class Result:
     @property
     def log(self):
         """The service's messages, each without its final line feed."""
-        messages = []
+        return [text for level, text in self._lines() if level != "warning"]
+
+    @property
+    def warnings(self):
+        """The platform's warnings, each without its final line feed."""
+        return [text for level, text in self._lines() if level == "warning"]
+
+    def _lines(self):
+        lines = []
         for line in self.errors.splitlines():
-            if line.startswith(("debug: ", "error: ")):
-                messages.append(line[len("debug: "):])
-            elif messages:
-                messages[-1] += "\n" + line.strip()
-        return messages
+            if line.startswith(("debug: ", "error: ", "warning: ")):
+                lines.append(line.split(": ", 1))
+            elif lines:
+                lines[-1][1] += "\n" + line.strip()
+        return lines
 
 
 class MachineTest(unittest.TestCase):

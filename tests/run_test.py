@@ -1,5 +1,6 @@
 #!/usr/bin/env python3
 """Whole runs over a real journal: compares every row of the spool and every line of the log."""
+import os
 import re
 import subprocess
 
@@ -95,6 +96,13 @@ class MixedDay(MachineTest):
         result = self.run_clean(TESSEL_LOG_LEVEL="error")
         self.assertEqual(result.log, [])
         self.assert_rows(self.expected())
+
+    def test_without_a_journal_lines_go_to_stderr(self):
+        without_journal = "[ ! -d /run/systemd/journal ] || mount -n -t tmpfs none /run/systemd/journal; exec $0"
+        command = ["sh", "-c", without_journal, os.path.join(harness.BIN, "tessel_reporter")]
+        result = subprocess.run(harness.in_namespace_argv(self.machine.var_tmp, command), text=True, check=True,
+                                env=self.machine.environment(TESSEL_LOG="journal"), capture_output=True)
+        self.assertIn("debug: Checking in\n", result.stderr)
 
 
 class NotTasked(MachineTest):

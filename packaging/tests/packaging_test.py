@@ -125,11 +125,19 @@ class Texts(unittest.TestCase):
 
     def test_every_message_with_an_id_is_in_the_catalog(self):
         with open(os.path.join(ROOT, "src", "linux", "LogSinks.cpp"), encoding="utf-8") as source:
-            ids = re.findall(r'"([0-9a-f]{32})"', source.read())
+            table = dict(re.findall(r'\{"([^"]+)",\s+"([0-9a-f]{32})"\}', source.read()))
+        ids = list(table.values())
         with open(os.path.join(SYSTEMD, "tessel.catalog"), encoding="utf-8") as catalog:
             text = catalog.read()
         self.assertEqual(sorted(ids), sorted(re.findall(r"(?m)^-- ([0-9a-f]{32})$", text)))
         self.assertEqual(text.count("\nSubject: "), len(ids))
+        warnings = []
+        for path in glob.glob(os.path.join(ROOT, "src", "**", "*.cpp"), recursive=True):
+            if not path.endswith("_test.cpp"):
+                with open(path, encoding="utf-8") as source:
+                    warnings += re.findall(r'\.warning\(\s*"([^"]+)', source.read())
+        self.assertTrue(warnings)
+        self.assertEqual([text for text in warnings if not text.startswith(tuple(table))], [])
 
     def test_completion(self):
         script = os.path.join(PACKAGING, "completion", "tesselctl")

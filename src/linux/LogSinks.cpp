@@ -12,6 +12,7 @@
 #include <sys/stat.h>
 #include <sys/uio.h>
 #include <systemd/sd-journal.h>
+#include <unistd.h>
 
 #include "os/Files.h"
 #include "platform/Text.h"
@@ -33,7 +34,30 @@ constexpr struct {
     {"Not reporting ", "aab21dd8ab154e9e9b6bcf90786745c9"},
     {"Trying to stop in-flight reporting work.", "028e77c9a30243d590fb466bdd747234"},
     {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
+    {"The record of the run is not written: ", "5ec5b861dea7400ab6f514dfd29986f8"},
 };
+
+struct LevelNames {
+  std::string_view onStderr;
+  char priority;  // syslog's number
+};
+
+constexpr LevelNames namesOf(LogLevel level) {
+  switch (level) {
+    case LogLevel::error:
+      return {"error: ", '3'};
+    case LogLevel::warning:
+      return {"warning: ", '4'};
+    case LogLevel::debug:
+      break;
+  }
+  return {"debug: ", '7'};
+}
+
+bool isSocket(const std::string& path) {
+  struct stat facts {};
+  return ::stat(path.c_str(), &facts) == 0 && S_ISSOCK(facts.st_mode);
+}
 
 }  // namespace
 
@@ -43,7 +67,7 @@ StderrLog::StderrLog(std::string_view program, int fd)
 void StderrLog::write(LogLevel level, std::string_view /*subsystem*/, std::string_view /*category*/,
                       std::string_view text) {
   if (text.ends_with('\n')) text.remove_suffix(1);
-  std::string line = lineStart_ + (level == LogLevel::error ? "error: " : "debug: ");
+  std::string line = lineStart_ + std::string(namesOf(level).onStderr);
   line += plainText(text, "\n    ");
   line += '\n';
   // One write for the whole line, so that the lines of several threads do not mix.
@@ -52,10 +76,8 @@ void StderrLog::write(LogLevel level, std::string_view /*subsystem*/, std::strin
 
 std::vector<std::string> journalFields(LogLevel level, std::string_view subsystem,
                                        std::string_view category, std::string_view text) {
-  // Syslog's numbers for error and debug.
-  const char* priority = level == LogLevel::error ? "3" : "7";
   std::vector<std::string> fields{
-      "MESSAGE=" + std::string(text), "PRIORITY=" + std::string(priority),
+      "MESSAGE=" + std::string(text), std::string("PRIORITY=") + namesOf(level).priority,
       "LOG_SUBSYSTEM=" + std::string(subsystem), "LOG_CATEGORY=" + std::string(category),
       "SYSLOG_IDENTIFIER=" + std::string(category)};
   for (const auto& message : kCatalogedMessages) {
@@ -68,6 +90,9 @@ std::vector<std::string> journalFields(LogLevel level, std::string_view subsyste
 
 void JournalLog::write(LogLevel level, std::string_view subsystem, std::string_view category,
                        std::string_view text) {
+  // libsystemd answers success where no socket exists, so that programs run without a journal. The
+  // line would be lost, so we look first. A look costs a microsecond, and the line ten.
+  if (!isSocket(socket_)) return fallback_.write(level, subsystem, category, text);
   std::vector<std::string> fields = journalFields(level, subsystem, category, text);
   std::vector<iovec> parts;
   parts.reserve(fields.size());
@@ -80,12 +105,10 @@ void JournalLog::write(LogLevel level, std::string_view subsystem, std::string_v
 
 std::unique_ptr<LogSink> makeLogSink(std::optional<LogDestination> destination,
                                      std::string_view program, const std::string& journalSocket) {
-  struct stat facts {};
-  const bool hasJournal = ::stat(journalSocket.c_str(), &facts) == 0 && S_ISSOCK(facts.st_mode);
   const LogDestination automatic =
-      hasJournal ? LogDestination::journal : LogDestination::standardError;
+      isSocket(journalSocket) ? LogDestination::journal : LogDestination::standardError;
   if (destination.value_or(automatic) == LogDestination::journal)
-    return std::make_unique<JournalLog>(program);
+    return std::make_unique<JournalLog>(program, STDERR_FILENO, journalSocket);
   return std::make_unique<StderrLog>(program);
 }
 

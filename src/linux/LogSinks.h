@@ -9,6 +9,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "linux/LaunchConfiguration.h"
@@ -16,9 +17,12 @@
 
 namespace tessel {
 
-// Writes one line per message: "error: text" or "debug: text". A line feed that ends the text ends
-// the line. The text's further lines are indented and its control characters become \xNN, so that
-// text from outside can neither start a line of its own nor command a terminal.
+inline constexpr char kJournalSocket[] = "/run/systemd/journal/socket";
+
+// Writes one line per message: "error: text", "warning: text" or "debug: text". A line feed that
+// ends the text ends the line. The text's further lines are indented and its control characters
+// become \xNN, so that text from outside can neither start a line of its own nor command a
+// terminal.
 class StderrLog final : public LogSink {
  public:
   // `program` and ": " stand before each line, unless it is empty. `fd` is not owned.
@@ -32,16 +36,20 @@ class StderrLog final : public LogSink {
 };
 
 // Writes one journal entry per message and leaves the text as it is. A message that cannot be sent
-// goes to standard error. If the journal's socket does not exist at all, libsystemd reports success
-// and the message is lost; makeLogSink() chooses this sink then only if it is told to.
+// goes to standard error.
 class JournalLog final : public LogSink {
  public:
-  explicit JournalLog(std::string_view program = {}) : fallback_(program) {}
+  // `fd` is the standard error of the fallback, and is not owned. `socket` is only looked at:
+  // messages always go to the machine's journal.
+  explicit JournalLog(std::string_view program = {}, int fd = 2,
+                      std::string socket = kJournalSocket)
+      : fallback_(program, fd), socket_(std::move(socket)) {}
   void write(LogLevel level, std::string_view subsystem, std::string_view category,
              std::string_view text) override;
 
  private:
   StderrLog fallback_;
+  const std::string socket_;
 };
 
 // The fields of one message's journal entry, each NAME=value. The category is the identifier that
@@ -52,8 +60,8 @@ std::vector<std::string> journalFields(LogLevel level, std::string_view subsyste
 
 // Makes the sink for `destination`. If that is absent, the sink is the journal if its socket
 // exists, and standard error otherwise. See StderrLog for `program`.
-std::unique_ptr<LogSink> makeLogSink(
-    std::optional<LogDestination> destination, std::string_view program = {},
-    const std::string& journalSocket = "/run/systemd/journal/socket");
+std::unique_ptr<LogSink> makeLogSink(std::optional<LogDestination> destination,
+                                     std::string_view program = {},
+                                     const std::string& journalSocket = kJournalSocket);
 
 }  // namespace tessel

@@ -42,6 +42,7 @@ TEST(StderrLogTest, ForeignTextCannotStartALine) {
   };
   for (const auto& [text, line] : kCases) EXPECT_EQ(linesOf(LogLevel::debug, text), line);
   EXPECT_EQ(linesOf(LogLevel::error, "Could not"), "error: Could not\n");
+  EXPECT_EQ(linesOf(LogLevel::warning, "Lost"), "warning: Lost\n");
   EXPECT_EQ(linesOf(LogLevel::error, "a\nb", "program"), "program: error: a\n    b\n");
 }
 
@@ -52,6 +53,7 @@ TEST(JournalLogTest, AnEntryIsNeverATracePoint) {
                           "MESSAGE=Checking in\nTESSEL_KIND=event\n", "PRIORITY=7",
                           "LOG_SUBSYSTEM=com.vantor.TesselSupport", "LOG_CATEGORY=tessel_reporter",
                           "SYSLOG_IDENTIFIER=tessel_reporter"));
+  EXPECT_THAT(journalFields(LogLevel::warning, "", "", ""), ::testing::Contains("PRIORITY=4"));
   EXPECT_THAT(journalFields(LogLevel::error, "", "statora_forwarder", ""),
               ::testing::IsSupersetOf({"PRIORITY=3", "SYSLOG_IDENTIFIER=statora_forwarder"}));
   EXPECT_THAT(journalFields(LogLevel::debug, "", "", "Bailing due to cookie file"),

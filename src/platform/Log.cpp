@@ -5,6 +5,7 @@
 
 #include "platform/Log.h"
 
+#include <algorithm>
 #include <cstdio>
 
 namespace tessel {
@@ -55,7 +56,9 @@ void setLogSink(LogSink* sink, LogLevel level) {
   // The sink comes first, so that an enabled level has its sink. isEnabled() must be cheap and
   // reads the level without ordering, so write() still checks that there is a sink.
   installedSink.store(sink, std::memory_order_release);
-  detail::enabledLogLevels.store(sink ? static_cast<int>(level) + 1 : 0, std::memory_order_release);
+  const LogLevel enabled = std::max(level, LogLevel::warning);
+  detail::enabledLogLevels.store(sink ? static_cast<int>(enabled) + 1 : 0,
+                                 std::memory_order_release);
 }
 
 void LogHandle::write(LogLevel level, const std::string& text) const {
@@ -66,6 +69,11 @@ void LogHandle::write(LogLevel level, const std::string& text) const {
 
 const LogHandle& tesselReporterLog() {
   static constexpr LogHandle handle("com.vantor.TesselSupport", "tessel_reporter");
+  return handle;
+}
+
+const LogHandle& platformLog() {
+  static constexpr LogHandle handle("com.vantor.TesselSupport", "tessel_reporter.platform");
   return handle;
 }
 

@@ -1,5 +1,6 @@
-// The system log: message texts that the compiler checks, levels, the sink behind them, and the
-// service's handle, tesselReporterLog().
+// The system log: message texts that the compiler checks, levels, the sink behind them, and two
+// handles. The service itself writes to tesselReporterLog(), and the parts beneath it write their
+// warnings to platformLog().
 //
 // The conversions of a text are %@ (a string or a thing with a description()), %s (text), %llu and
 // %lu (unsigned 64-bit), %ld (signed 64-bit), %u (unsigned 32-bit), %f and %.2f (floating point). A
@@ -133,7 +134,7 @@ std::string formatLog(std::string_view text, Args&&... arguments) {
   return formatLogArguments(text, {std::forward<Args>(arguments)...});
 }
 
-enum class LogLevel { error = 0, debug = 1 };
+enum class LogLevel { error = 0, warning = 1, debug = 2 };
 
 // Where lines go. Any thread may call write() at any time.
 class LogSink {
@@ -143,8 +144,9 @@ class LogSink {
                      std::string_view text) = 0;
 };
 
-// Sends the lines of `level` and of more important ones to `sink`. A null sink discards all. The
-// caller keeps the sink until the last thread that logs has ended.
+// Sends the lines of `level` and of more important ones to `sink`. Errors and warnings are sent at
+// every level, because an administrator must learn of a loss without asking for more lines first. A
+// null sink discards all. The caller keeps the sink until the last thread that logs has ended.
 void setLogSink(LogSink* sink, LogLevel level);
 
 // Names the program that logs. Each program has one handle, whose category is its name in the log.
@@ -161,6 +163,11 @@ class LogHandle {
       write(LogLevel::debug, formatLog(format.text(), LogArgument(args)...));
   }
   template <typename... Args>
+  void warning(LogFormat<std::type_identity_t<Args>...> format, const Args&... args) const {
+    if (isEnabled(LogLevel::warning))
+      write(LogLevel::warning, formatLog(format.text(), LogArgument(args)...));
+  }
+  template <typename... Args>
   void error(LogFormat<std::type_identity_t<Args>...> format, const Args&... args) const {
     if (isEnabled(LogLevel::error))
       write(LogLevel::error, formatLog(format.text(), LogArgument(args)...));
@@ -175,6 +182,14 @@ class LogHandle {
 
 // The service's handle: subsystem "com.vantor.TesselSupport", category "tessel_reporter".
 const LogHandle& tesselReporterLog();
+
+// The platform's handle: the same subsystem, category "tessel_reporter.platform". It is for
+// warnings: what costs a writer, a row or a run is one line per run and reason. It is apart from
+// the service's handle, whose lines are fixed texts that other programs may look for.
+//
+// Each warning has an identifier by which `journalctl -x` explains it. The table is
+// kCatalogedMessages in linux/LogSinks.cpp; a test looks for each text there.
+const LogHandle& platformLog();
 
 namespace detail {
 // One above the highest enabled level; 0 if nothing is enabled.

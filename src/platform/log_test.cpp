@@ -23,7 +23,7 @@ TEST(LogTest, FillsEveryConversionInOrder) {
   EXPECT_EQ(log.errors().size(), 1u);
 }
 
-TEST(LogTest, DescribesNothingWhereTheLevelIsOff) {
+TEST(LogTest, AtTheErrorLevelOnlyWarningsAreFormatted) {
   struct Counting {
     int* asked;
     std::string description() const { return std::to_string(++*asked); }
@@ -32,7 +32,8 @@ TEST(LogTest, DescribesNothingWhereTheLevelIsOff) {
   testing::RecordingLog log(LogLevel::error);
   tesselReporterLog().debug("%@", Counting{&asked});
   EXPECT_EQ(asked, 0);
-  EXPECT_TRUE(log.lines().empty());
+  platformLog().warning("%@ is lost", Thing{});
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"a/b is lost"});
 }
 
 }  // namespace

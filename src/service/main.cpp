@@ -68,7 +68,7 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
     addRows(record, spool.figures());
     record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
     if (const auto failure = writeRunRecord(record, stateDirectory)) {
-      tesselReporterLog().debug("Could not keep the record of the run: %@", failure->words);
+      platformLog().warning("The record of the run is not written: %@", failure->words);
     }
   }
   spool.beginRun();
