@@ -1,5 +1,6 @@
 #!/usr/bin/env python3
 """The forwarder against collectors that accept, refuse, stall, answer nonsense or break the connection."""
+import contextlib
 import email.utils
 import json
 import os
@@ -14,6 +15,7 @@ import time
 import unittest
 
 import harness
+from faults.fault_machine import FaultMachine
 from otlp_receiver import Answer, Receiver, make_certificate, uid_of
 
 FORWARDER = os.path.join(harness.BIN, "statora_forwarder")
@@ -30,7 +32,7 @@ PRAGMA user_version=1;
 
 def make_spool(state):
     path = os.path.join(state, "statora.db")
-    with sqlite3.connect(path) as database:
+    with contextlib.closing(sqlite3.connect(path, isolation_level=None)) as database:
         database.executescript(SCHEMA)
         database.execute("INSERT INTO meta VALUES('spool_id', ?)", (SPOOL_ID,))
     return path
@@ -260,6 +262,37 @@ class Trouble(ForwarderTest):
             result = self.run_forwarder(receiver, OTEL_EXPORTER_OTLP_CERTIFICATE=right[0])
             self.assertEqual(result.returncode, 0, self.errors)
         self.assert_all_arrived_once(receiver, 3)
+
+
+class PowerCut(ForwarderTest):
+    def test_no_id_is_sent_before_the_disk_has_its_row(self):
+        durable, cut = os.path.join(self.state, "durable"), os.path.join(self.state, "cut")
+        for folder in (durable, cut):
+            os.mkdir(folder)
+        shutil.copy(self.path, cut)
+        survived = []
+
+        def look(request, _):
+            """What the spool would hold if the power failed now."""
+            shutil.copy(os.path.join(durable, "statora.db-wal"), cut)
+            with sqlite3.connect(os.path.join(cut, "statora.db")) as database:
+                survived.append(database.execute("SELECT max(id), (SELECT seq FROM sqlite_sequence) FROM events")
+                                .fetchone())
+            return Answer()
+
+        writer = sqlite3.connect(self.path, isolation_level=None)
+        self.addCleanup(writer.close)  # open to the end: a writer that closes would move the log into the file
+        writer.execute("PRAGMA synchronous=OFF")
+        for _ in range(3):
+            writer.execute("INSERT INTO events(time, name, payload) VALUES(1, 'a', '{}')")
+        with Receiver(look) as receiver:
+            self.run_forwarder(receiver, **FaultMachine.faults(DURABLE=durable))
+        self.assertEqual(survived, [(3, 3)], self.errors)
+        writer.execute("INSERT INTO events(time, name, payload) VALUES(1, 'a', '{}')")
+        with Receiver() as receiver:
+            result = self.run_forwarder(receiver, **FaultMachine.faults(CALL="fdatasync", PATH="-wal", AT=1, ERRNO=5))
+        self.assertEqual((result.returncode, receiver.requests), (66, []))
+        self.assertIn("the write-ahead log cannot be flushed: Input/output error", self.errors)
 
 
 class Process(ForwarderTest):

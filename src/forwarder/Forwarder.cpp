@@ -108,7 +108,12 @@ ForwarderOutcome Forwarder::deliverAll() {
   reason_.clear();
   for (;;) {
     std::vector<SpooledEvent> events = world_.state.oldest(options_.maxRecords, options_.maxBytes);
-    if (SqliteStatus status = world_.state.status(); !status.ok()) {
+    SqliteStatus status = world_.state.status();
+    // The service's commits may not be on disk yet. If a power cut took a row back after we sent
+    // it, the service would give its id to another event, and the collector would drop that one as
+    // a duplicate. So nothing leaves before the disk has it, at the price of one flush a batch.
+    if (status.ok() && !events.empty()) status = world_.state.flushLog();
+    if (!status.ok()) {
       reason_ = status.reason;
       return ForwarderOutcome::spoolFailed;
     }

@@ -67,6 +67,8 @@ class ForwarderState {
   // Empty if that fails; status() then says why.
   std::vector<SpooledEvent> oldest(size_t maxRows, size_t maxBytes, int64_t after = 0);
   SqliteStatus status() const { return database_.status(); }
+  // Makes the rows that oldest() has answered survive a power cut. REQUIRES: oldest() was called.
+  SqliteStatus flushLog() { return database_.flushLog(); }
   // About how many rows wait. It is the span of their ids, because counting would read the table.
   uint64_t waiting();
 

@@ -8,6 +8,7 @@
 
 #include <sqlite3.h>
 
+#include <cerrno>
 #include <cstring>
 #include <utility>
 
@@ -133,6 +134,22 @@ std::optional<std::string> SqliteDatabase::text(std::string_view query) {
   SqliteStatement statement = prepare(query);
   if (!statement.prepared() || statement.step() != SqliteStatement::Step::row) return {};
   return std::string(statement.text(0));
+}
+
+// SQLite has no call for this, and a descriptor of our own would not do: closing it would drop the
+// locks that SQLite holds on the log's file. So the flush goes through the file that SQLite has
+// open. The commits need no more than the log: before SQLite reuses the log from its beginning, a
+// checkpoint has moved its pages into the database and has flushed the database.
+SqliteStatus SqliteDatabase::flushLog() {
+  sqlite3_file* log = nullptr;
+  const int asked = sqlite3_file_control(handle_, "main", SQLITE_FCNTL_JOURNAL_POINTER, &log);
+  if (asked != SQLITE_OK) return {asked, "the write-ahead log cannot be found"};
+  // Without methods the file is not open. Then there is a rollback journal instead of a log, and
+  // its commits are on disk already.
+  if (log == nullptr || log->pMethods == nullptr) return {};
+  const int flushed = log->pMethods->xSync(log, SQLITE_SYNC_NORMAL | SQLITE_SYNC_DATAONLY);
+  if (flushed == SQLITE_OK) return {};
+  return {flushed, std::string("the write-ahead log cannot be flushed: ") + std::strerror(errno)};
 }
 
 SqliteStatus SqliteDatabase::status() const {
