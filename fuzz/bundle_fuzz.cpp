@@ -11,7 +11,7 @@
 #include <string>
 #include <string_view>
 
-#include "linux/SystemFacts.h"
+#include "linux/AppBundles.h"
 
 namespace {
 

@@ -1,6 +1,6 @@
 // Identifiers of application directories, some of them not meant well.
 
-#include "linux/SystemFacts.h"
+#include "linux/AppBundles.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <deque>
 
+#include "linux/AppBundles.h"
 #include "linux/LaunchConfiguration.h"
 #include "linux/LogSinks.h"
 #include "linux/RunRecordFile.h"

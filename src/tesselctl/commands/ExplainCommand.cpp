@@ -8,6 +8,7 @@
 #include <memory>
 
 #include "journal/EntryStream.h"
+#include "linux/AppBundles.h"
 #include "linux/SystemFacts.h"
 #include "platform/Text.h"
 #include "service/ObjectReporter.h"
