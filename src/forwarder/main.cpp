@@ -70,7 +70,8 @@ int requeue(const std::string& stateDirectory) {
 // Makes SIGTERM and SIGINT end every wait and the present request. Otherwise a collector that hangs
 // would keep the process until the timeout.
 void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
-  const auto queue = std::make_shared<WorkerQueue>("statora_forwarder signal queue");
+  const auto queue =
+      std::make_shared<WorkerQueue>("statora_forwarder signal queue", QueueThread::own);
   for (const int signalNumber : {SIGTERM, SIGINT}) {
     const auto source = std::make_shared<ThreadSignalSource>(signalNumber, queue);
     source->setHandler([&stop, &collector] {

@@ -17,15 +17,19 @@ namespace {
 
 // A year. A longer wait is surely a typing mistake, and sums of such times cannot overflow.
 constexpr int64_t kMaxSeconds = 31'536'000;
+constexpr int64_t kMaxDays = 36'500;  // a hundred years, for the same reason
+// A run may fill an eighth of the spool. An eighth of 4 MiB holds four rows of the largest size.
+constexpr int64_t kMinSpoolBytes = int64_t{4} << 20;
+constexpr int64_t kMaxSpoolBytes = int64_t{1} << 40;
 constexpr size_t kMaxQuotedValue = 256;  // so that the error stays one readable line
 constexpr std::string_view kBlanks = " \t";
 
-std::optional<std::chrono::seconds> wholeSeconds(std::string_view text) {
-  int64_t seconds = 0;
+std::optional<int64_t> wholeNumber(std::string_view text, int64_t least, int64_t most) {
+  int64_t number = 0;
   const char* end = text.data() + text.size();
-  const auto [stopped, error] = std::from_chars(text.data(), end, seconds);
-  if (error != std::errc() || stopped != end || seconds < 1 || seconds > kMaxSeconds) return {};
-  return std::chrono::seconds{seconds};
+  const auto [stopped, error] = std::from_chars(text.data(), end, number);
+  if (error != std::errc() || stopped != end || number < least || number > most) return {};
+  return number;
 }
 
 bool enableSource(DeferSources& sources, std::string_view word) {
@@ -79,6 +83,20 @@ class VariableReader {
       error_ = LaunchError{variable, *text, expected};
     }
   }
+  // A number of `Unit`s, as "30".
+  template <typename Unit>
+  void readNumber(const std::string& variable, auto& target, const std::string& unit, int64_t least,
+                  int64_t most) {
+    const std::string expected = "a whole number of " + unit + " from " + std::to_string(least) +
+                                 " to " + std::to_string(most);
+    read(variable, target, expected, [least, most](std::string_view text) {
+      const std::optional<int64_t> number = wholeNumber(text, least, most);
+      return number ? std::optional(Unit(*number)) : std::nullopt;
+    });
+  }
+  void readSeconds(const std::string& variable, auto& target, int64_t least) {
+    readNumber<std::chrono::seconds>(variable, target, "seconds", least, kMaxSeconds);
+  }
   void readPath(const std::string& variable, auto& target) {
     read(variable, target, "a path", [](std::string_view text) {
       return text.empty() ? std::nullopt : std::optional(std::string(text));
@@ -113,7 +131,6 @@ std::string LaunchError::line() const {
 
 std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
     const EnvironmentReader& environment) {
-  constexpr const char* kSeconds = "a whole number of seconds from 1 to 31536000";
   LaunchConfiguration configuration;
   if (auto managed = managedDirectory(environment, "STATE_DIRECTORY")) {
     configuration.stateDirectory = *managed;
@@ -126,10 +143,15 @@ std::variant<LaunchConfiguration, LaunchError> readLaunchConfiguration(
   variables.readPath("TESSEL_TRACE_STORE", configuration.traceStore);
   variables.readPath("TESSEL_STATE_DIR", configuration.stateDirectory);
   variables.readPath("TESSEL_CONFIG_DIR", configuration.configurationDirectory);
-  variables.read("TESSEL_ACTIVITY_INTERVAL", configuration.activityInterval, kSeconds,
-                 wholeSeconds);
-  variables.read("TESSEL_DEFER_RETRY", configuration.deferRetry, kSeconds, wholeSeconds);
+  variables.readSeconds("TESSEL_ACTIVITY_INTERVAL", configuration.activityInterval, 1);
+  variables.readSeconds("TESSEL_DEFER_RETRY", configuration.deferRetry, 1);
   variables.read("TESSEL_DEFER_ON", configuration.deferOn, expectedDeferWords(), deferSources);
+  variables.readSeconds("TESSEL_RUN_LIMIT", configuration.runLimit, 0);
+  variables.readSeconds("TESSEL_DEFER_LIMIT", configuration.deferLimit, 0);
+  variables.readNumber<uint64_t>("TESSEL_SPOOL_LIMIT", configuration.spoolLimitBytes, "bytes",
+                                 kMinSpoolBytes, kMaxSpoolBytes);
+  variables.readNumber<std::chrono::days>("TESSEL_SPOOL_DAYS", configuration.spoolDays, "days", 0,
+                                          kMaxDays);
   variables.read("TESSEL_LOG", configuration.logDestination, "journal or stderr", logDestination);
   variables.read("TESSEL_LOG_LEVEL", configuration.logLevel, "error or debug", logLevel);
   variables.readPath("TESSEL_OS_RELEASE", configuration.osReleasePath);

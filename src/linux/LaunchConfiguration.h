@@ -4,6 +4,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <functional>
 #include <optional>
 #include <string>
@@ -52,6 +53,11 @@ struct LaunchConfiguration {
   std::optional<std::chrono::seconds> activityInterval;  // absent: one run, then the process ends
   std::chrono::seconds deferRetry{900};
   DeferSources deferOn = allDeferSources();
+  std::chrono::seconds runLimit{21'600};  // the longest run; zero: no limit
+  // For how long battery and pressure may put one run off, in all. Zero: not at all.
+  std::chrono::seconds deferLimit{7200};
+  uint64_t spoolLimitBytes = uint64_t{1} << 30;  // of the database and its log together
+  std::chrono::days spoolDays{30};               // how long a row may stay; zero: for ever
   std::optional<LogDestination> logDestination;  // absent: the journal where there is one
   LogLevel logLevel = LogLevel::error;
   std::string osReleasePath = "/etc/os-release";

@@ -26,7 +26,6 @@
 #include <filesystem>
 #include <mutex>
 #include <system_error>
-#include <thread>
 #include <utility>
 #include <vector>
 
@@ -178,13 +177,13 @@ BackgroundScheduler::BackgroundScheduler(ScheduleCriteria criteria, const StateD
 void BackgroundScheduler::registerActivity(const std::string& /*name*/, ActivityHandler handler) {
   // The process must not end while a delivery is pending. `pending` keeps it alive until the thread
   // ends.
-  std::thread([pending = runtime_.expectDelivery(),
-               deliveries = ActivityDeliveries(criteria_, state_, conditions_, status_, clock_,
-                                               std::move(handler))]() mutable {
+  const std::shared_ptr<KeepAliveTransaction> pending = runtime_.expectDelivery();
+  startThread([pending, deliveries = ActivityDeliveries(criteria_, state_, conditions_, status_,
+                                                        clock_, std::move(handler))]() mutable {
     deliveries.deliverCheckIn();
     while (deliveries.deliverRun()) {
     }
-  }).detach();
+  });
 }
 
 ActivityDeliveries::ActivityDeliveries(ScheduleCriteria criteria, const StateDirectory& state,

@@ -16,7 +16,6 @@
 
 #include <csignal>
 #include <cstdlib>
-#include <thread>
 #include <utility>
 
 #include "platform/Invariant.h"
@@ -135,10 +134,9 @@ void ThreadSignalSource::setHandler(Closure handler) { handler_ = std::move(hand
 void ThreadSignalSource::resume() {
   if (!queue_) return;
   TESSEL_INVARIANT(handler_ != nullptr);
-  std::thread([number = signalNumber_, queue = std::exchange(queue_, nullptr),
-               handler = std::exchange(handler_, nullptr)] {
-    deliverForEver(number, queue, handler);
-  }).detach();
+  startThread(
+      [number = signalNumber_, queue = std::exchange(queue_, nullptr),
+       handler = std::exchange(handler_, nullptr)] { deliverForEver(number, queue, handler); });
 }
 
 // Holds one of the runtime's two counters up by one for as long as it lives.

@@ -34,6 +34,10 @@ TEST(LaunchConfigurationTest, EveryVariableIsRead) {
                                                              {"TESSEL_ACTIVITY_INTERVAL", "86400"},
                                                              {"TESSEL_DEFER_RETRY", "1"},
                                                              {"TESSEL_DEFER_ON", "pressure, file"},
+                                                             {"TESSEL_RUN_LIMIT", "0"},
+                                                             {"TESSEL_DEFER_LIMIT", "0"},
+                                                             {"TESSEL_SPOOL_LIMIT", "4194304"},
+                                                             {"TESSEL_SPOOL_DAYS", "0"},
                                                              {"TESSEL_LOG", "stderr"},
                                                              {"TESSEL_LOG_LEVEL", "debug"},
                                                              {"TESSEL_OS_RELEASE", "/os-release"}});
@@ -43,6 +47,10 @@ TEST(LaunchConfigurationTest, EveryVariableIsRead) {
   EXPECT_EQ(configuration.activityInterval, std::chrono::seconds{86400});
   EXPECT_EQ(configuration.deferRetry, std::chrono::seconds{1});
   EXPECT_EQ(configuration.deferOn, (DeferSources{true, false, true}));
+  EXPECT_EQ(configuration.runLimit, std::chrono::seconds{0});
+  EXPECT_EQ(configuration.deferLimit, std::chrono::seconds{0});
+  EXPECT_EQ(configuration.spoolLimitBytes, 4'194'304u);
+  EXPECT_EQ(configuration.spoolDays, std::chrono::days{0});
   EXPECT_EQ(configuration.logDestination, LogDestination::standardError);
   EXPECT_EQ(configuration.logLevel, LogLevel::debug);
   EXPECT_EQ(configuration.osReleasePath, "/os-release");
@@ -78,6 +86,14 @@ TEST(LaunchConfigurationTest, NonsenseIsNamedOnOneLine) {
                 {"TESSEL_DEFER_ON", "file,network"},
                 {"TESSEL_DEFER_ON", "file,"},
                 {"TESSEL_DEFER_ON", "FILE"},
+                {"TESSEL_RUN_LIMIT", "-1"},
+                {"TESSEL_DEFER_LIMIT", "never"},
+                {"TESSEL_SPOOL_LIMIT", "0"},
+                {"TESSEL_SPOOL_LIMIT", "4194303"},
+                {"TESSEL_SPOOL_LIMIT", "1G"},
+                {"TESSEL_SPOOL_LIMIT", "99999999999999999999"},
+                {"TESSEL_SPOOL_DAYS", "-1"},
+                {"TESSEL_SPOOL_DAYS", "36501"},
                 {"TESSEL_LOG", "syslog"},
                 {"TESSEL_LOG_LEVEL", "verbose"},
                 {"TESSEL_TRACE_STORE", ""},

@@ -55,8 +55,9 @@ class SerialQueue {
 };
 
 // A timer that submits its handler to a queue, once when it is resumed and then every interval. A
-// firing may come late by up to the leeway. The timer goes on for as long as the process lives,
-// even after its last reference is dropped.
+// firing may come late by up to the leeway. While an earlier firing waits on the queue, no further
+// one is submitted: the handler would only run twice in a row. The timer goes on for as long as the
+// process lives, even after its last reference is dropped.
 class RepeatingTimer {
  public:
   virtual ~RepeatingTimer() = default;
@@ -75,29 +76,51 @@ class QueueFactory {
                                                              Closure handler) = 0;
 };
 
-// A queue on threads. It has a thread only while it has work, so an idle queue costs a few hundred
-// bytes. Nobody joins the threads, and the objects that they use are never destroyed. So the
-// process may end at any moment; see Queues.cpp.
+// Runs `body` on a new thread that nobody joins. A system that has no thread to give may have one a
+// moment later, so the call then waits and tries again.
+void startThread(Closure body);
+
+// Where a queue gets its thread from.
+enum class QueueThread {
+  shared,  // one of the pool's, while the queue has work
+  own,     // one that is made with the queue and serves no other
+};
+
+// A queue on threads. Nobody joins the threads, and the objects that they use are never destroyed.
+// So the process may end at any moment; see Queues.cpp.
+//
+// The queues with QueueThread::shared have a pool of a few threads between them, and none while
+// they have no work. An idle one costs a few hundred bytes. A closure on such a queue must not wait
+// for another queue: if all threads of the pool waited, nothing would run any more. sync() asserts
+// it. A queue with QueueThread::own always has its thread, so it waits for nobody else's work.
 class WorkerQueue final : public SerialQueue {
  public:
-  explicit WorkerQueue(std::string label);
+  explicit WorkerQueue(std::string label, QueueThread thread = QueueThread::shared);
+  WorkerQueue(const WorkerQueue&) = delete;
+  WorkerQueue& operator=(const WorkerQueue&) = delete;
+  ~WorkerQueue() override;
 
   const std::string& label() const override;
   void async(Closure work) override;
   void sync(const Closure& work) override;
 
+  // Makes the first thread of the pool, which never ends.
+  static void startPool();
+
  private:
   struct State;
   class Threads;
-  static void drain(State& state);
+  static void runAll(State& state, std::unique_lock<std::mutex>& lock);
+  static void serve(State& state);
 
   std::shared_ptr<State> state_;
 };
 
-// Makes queues on threads. All timers of the process share one thread, which only submits to
-// queues.
+// Makes queues that share the pool. All timers of the process share one thread, which only submits
+// to queues. The constructor makes the threads that must exist before there is work.
 class WorkerQueueFactory final : public QueueFactory {
  public:
+  WorkerQueueFactory();
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label) override;
   std::shared_ptr<RepeatingTimer> makeRepeatingTimer(std::shared_ptr<SerialQueue> queue,
                                                      std::chrono::nanoseconds interval,

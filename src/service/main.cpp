@@ -122,8 +122,10 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& clock = keep<SystemClock>();
   ServiceManager& manager = *connectServiceManager(clock).release();
   auto& runtime = keep<ServiceRuntime>(manager);
-  const auto processingQueue = std::make_shared<WorkerQueue>("tessel_reporter processing queue");
-  auto& reportingQueue = keep<WorkerQueue>("tessel_reporter Statora reporting queue");
+  const auto processingQueue =
+      std::make_shared<WorkerQueue>("tessel_reporter processing queue", QueueThread::own);
+  auto& reportingQueue =
+      keep<WorkerQueue>("tessel_reporter Statora reporting queue", QueueThread::own);
   const auto interruptSource = runtime.makeSignalSource(SIGINT, processingQueue);
   // SIGINT ends the process at once, even in the middle of a run. That run leaves its marker, so
   // the next run bails out.
