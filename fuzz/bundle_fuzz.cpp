@@ -57,7 +57,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   } else {
     makeFile(metainfo / "a.metainfo.xml", text);
   }
-  const auto identifier = tessel::AppBundles().bundleIdentifier(root.string());
+  static auto& mounts = *new tessel::MountTable;
+  const auto identifier = tessel::AppBundles(mounts).bundleIdentifier(root.string());
   if (!identifier) return 0;
   constexpr std::string_view kAllowed =
       "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-";

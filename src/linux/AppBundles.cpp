@@ -1,19 +1,28 @@
-// Reading bundle metadata.
+// Walking to a bundle and reading its metadata.
 //
-// An identifier decides what may be reported, so a doubtful one is worse than none. Two files of a
-// kind may contradict each other, and the order of the directory must not choose between them. We
-// do not control who wrote these directories, so every size is bounded.
+// An identifier names a program in what is reported, so a doubtful one is worse than none. Two
+// files of a kind may contradict each other, and the order of the directory must not choose between
+// them. Strangers wrote these directories, and may change them while we look. So every size is
+// bounded, and what was looked at is held by a descriptor until it is read.
 
 #include "linux/AppBundles.h"
 
+#include <dirent.h>
+#include <fcntl.h>
+#include <limits.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <filesystem>
+#include <memory>
 #include <pugixml.hpp>
 #include <string_view>
-#include <system_error>
+#include <utility>
 #include <vector>
 
 #include "os/Files.h"
+#include "os/UniqueFd.h"
 #include "platform/Text.h"
 
 namespace tessel {
@@ -23,6 +32,9 @@ namespace {
 constexpr size_t kMaxMetadataSize = size_t{1} << 20;  // usual ones have a few kilobytes
 constexpr size_t kMaxIdentifierLength = 255;          // of a D-Bus name
 constexpr size_t kMaxDirectoryEntries = 10'000;       // a root with more is no application's
+// Links can make a walk as long as their owner likes. This many steps take some 50 ms.
+constexpr size_t kMaxSteps = 10'000;
+constexpr int kMaxLinks = 40;  // of one path, as for the kernel; a link may lead to itself
 
 bool isLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
 bool isDigit(char c) { return c >= '0' && c <= '9'; }
@@ -58,23 +70,138 @@ bool hasSuffix(std::string_view name, const std::vector<std::string_view>& suffi
                      [&](std::string_view suffix) { return name.ends_with(suffix); });
 }
 
-// The files in `directory` with one of `suffixes`. It stops at the second one, because the caller
-// accepts only a single file. It also stops after kMaxDirectoryEntries, so it may miss files there.
-std::vector<std::filesystem::path> filesWithSuffix(const std::filesystem::path& directory,
-                                                   const std::vector<std::string_view>& suffixes) {
-  std::vector<std::filesystem::path> found;
-  std::error_code error;
-  std::filesystem::directory_iterator entry(directory, error);
-  const std::filesystem::directory_iterator end;
-  for (size_t seen = 0; !error && entry != end && seen < kMaxDirectoryEntries; ++seen) {
-    std::error_code unknown;
-    if (hasSuffix(entry->path().filename().native(), suffixes) && entry->is_regular_file(unknown)) {
-      found.push_back(entry->path());
-      if (found.size() == 2) break;
+// A file or directory that a walk has reached. The descriptor is an O_PATH one: it holds the inode
+// and opens nothing, so a device or a pipe under it stays as it is.
+struct Place {
+  UniqueFd fd;
+  std::string path;  // absolute, without links
+  struct stat facts {};
+};
+
+// Walks along paths component by component and follows links itself. The kernel would resolve a
+// path in one call, but then a link that someone made a moment ago could lead onto a dead mount,
+// which blocks for ever. openat2() can forbid other mounts as a whole, yet a bundle may well lie
+// under several local ones, and we would have to tell them apart here all the same.
+class Walk {
+ public:
+  explicit Walk(MountTable& mounts) : mounts_(mounts) {}
+
+  // Absent if "/" is not local.
+  std::optional<Place> root();
+  // The place at `path` below `from`. Absent if nothing is there, if the way leads over a mount
+  // that is not local, or if it leaves `from`.
+  std::optional<Place> to(const Place& from, std::string path);
+  // Whether the walk used up its steps, so that it may have missed what is there.
+  bool exhausted() const { return steps_ > kMaxSteps; }
+
+ private:
+  std::optional<Place> step(const Place& at, const std::string& name);
+
+  MountTable& mounts_;
+  size_t steps_ = 0;
+};
+
+std::optional<Place> Walk::root() {
+  Place place{UniqueFd(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC)), "/"};
+  if (!place.fd.valid() || !mounts_.isLocal(place.fd.get())) return {};
+  return place;
+}
+
+// The table is asked before the step, because a step onto some mounts already calls the server. A
+// mount that comes between the question and the step is found by its id. It was not touched then:
+// O_PATH opens nothing, and fstat() comes last.
+std::optional<Place> Walk::step(const Place& at, const std::string& name) {
+  Place next{{}, (at.path == "/" ? "" : at.path) + '/' + name};
+  // A name with a zero byte would be another name for the kernel than for the table.
+  if (++steps_ > kMaxSteps || next.path.size() > PATH_MAX || name.find('\0') != std::string::npos)
+    return {};
+  if (!mounts_.mayStepOnto(next.path)) return {};
+  next.fd = UniqueFd(::openat(at.fd.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (!next.fd.valid() || !mounts_.isLocal(next.fd.get())) return {};
+  if (::fstat(next.fd.get(), &next.facts) != 0) return {};
+  return next;
+}
+
+std::optional<std::string> linkTarget(const Place& link) {
+  char target[PATH_MAX];
+  const ssize_t length = ::readlinkat(link.fd.get(), "", target, sizeof target);
+  if (length <= 0) return {};
+  return std::string(target, static_cast<size_t>(length));
+}
+
+std::optional<Place> Walk::to(const Place& from, std::string path) {
+  std::optional<Place> reached;  // absent while the walk stands at `from`
+  int links = 0;
+  while (path.size() <= PATH_MAX) {
+    const size_t begin = std::min(path.find_first_not_of('/'), path.size());
+    const size_t end = std::min(path.find('/', begin), path.size());
+    const std::string name = path.substr(begin, end - begin);
+    path.erase(0, end);
+    if (name.empty()) return reached;
+    if (name == ".") continue;
+    if (name == "..") {
+      // The parent's path has no links, so we walk it anew. Going up by ".." could meet a mount.
+      if (!reached && from.path == "/") continue;
+      if (!reached || ++steps_ > kMaxSteps) return {};
+      const size_t parent = reached->path.rfind('/');
+      path.insert(
+          0, reached->path.substr(0, parent).erase(0, from.path == "/" ? 0 : from.path.size()));
+      reached.reset();
+      continue;
     }
-    entry.increment(error);
+    auto next = step(reached ? *reached : from, name);
+    if (!next) return {};
+    if (!S_ISLNK(next->facts.st_mode)) {
+      reached = std::move(next);
+      continue;
+    }
+    const auto target = linkTarget(*next);
+    if (!target || ++links > kMaxLinks) return {};
+    if (target->starts_with('/')) {
+      if (from.path != "/") return {};
+      reached.reset();
+    }
+    path.insert(0, *target);
   }
-  return found;
+  return {};
+}
+
+// What a bundle has of one kind of file.
+struct OneFile {
+  std::optional<Place> file;
+  std::string name;
+  bool unclear = false;  // there are several files, or we could not look at all entries
+};
+
+struct CloseDirectory {
+  void operator()(DIR* directory) const { ::closedir(directory); }
+};
+
+// The one file that stands in `place` under a name with one of `suffixes`. `path` is the way from
+// the bundle to the place.
+OneFile oneFile(Walk& walk, const Place& bundle, const std::string& path, const Place& place,
+                const std::vector<std::string_view>& suffixes) {
+  OneFile one;
+  const int fd = ::openat(place.fd.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  const std::unique_ptr<DIR, CloseDirectory> directory(fd < 0 ? nullptr : ::fdopendir(fd));
+  if (!directory) return one;
+  size_t seen = 0;
+  while (const dirent* entry = ::readdir(directory.get())) {
+    const std::string name = entry->d_name;
+    if (name == "." || name == "..") continue;
+    if (++seen > kMaxDirectoryEntries) one.unclear = true;
+    if (hasSuffix(name, suffixes)) {
+      // From the bundle and not from here: a link may lead to anywhere within the bundle.
+      auto file = walk.to(bundle, path + name);
+      if (!file || !S_ISREG(file->facts.st_mode)) continue;
+      one.unclear |= one.file.has_value();
+      one.file = std::move(file);
+      one.name = name;
+    }
+    if (one.unclear) break;
+  }
+  one.unclear |= walk.exhausted();
+  return one;
 }
 
 // The parser accepts a document with several root elements, which is not well-formed XML.
@@ -85,8 +212,11 @@ bool hasOneRoot(const pugi::xml_document& document) {
   return std::count_if(document.begin(), document.end(), isElement) == 1;
 }
 
-std::optional<std::string> componentId(const std::filesystem::path& file) {
-  const std::optional<std::string> text = readSmallFile(file.string(), kMaxMetadataSize);
+// Absent if the file says nothing usable. The descriptor leads to the inode that was looked at, so
+// nobody can put a device under its name in the meantime.
+std::optional<std::string> componentId(const Place& file) {
+  const std::optional<std::string> text =
+      readSmallFile("/proc/self/fd/" + std::to_string(file.fd.get()), kMaxMetadataSize);
   pugi::xml_document document;
   if (!text || !document.load_buffer(text->data(), text->size()) || !hasOneRoot(document))
     return {};
@@ -98,14 +228,21 @@ std::optional<std::string> componentId(const std::filesystem::path& file) {
 }  // namespace
 
 std::optional<std::string> AppBundles::bundleIdentifier(const std::string& directory) {
-  const std::filesystem::path root(directory);
-  const auto metadata =
-      filesWithSuffix(root / "usr/share/metainfo", {".metainfo.xml", ".appdata.xml"});
-  if (metadata.size() == 1) return componentId(metadata[0]);
-  if (!metadata.empty()) return {};
-  const auto desktopFiles = filesWithSuffix(root, {".desktop"});
-  if (desktopFiles.size() != 1) return {};
-  const std::string stem = desktopFiles[0].stem().string();
+  Walk walk(mounts_);
+  const auto root = walk.root();
+  const auto bundle =
+      root ? walk.to(*root, std::filesystem::absolute(directory).native()) : std::nullopt;
+  if (!bundle) return {};
+  constexpr const char* kMetadataPath = "usr/share/metainfo/";
+  if (const auto metainfo = walk.to(*bundle, kMetadataPath)) {
+    const OneFile metadata =
+        oneFile(walk, *bundle, kMetadataPath, *metainfo, {".metainfo.xml", ".appdata.xml"});
+    if (metadata.unclear) return {};
+    if (const auto id = metadata.file ? componentId(*metadata.file) : std::nullopt) return id;
+  }
+  const OneFile desktop = oneFile(walk, *bundle, "", *bundle, {".desktop"});
+  if (desktop.unclear || !desktop.file) return {};
+  const std::string stem = std::filesystem::path(desktop.name).stem().native();
   if (!isReverseDns(stem)) return {};
   return stem;
 }

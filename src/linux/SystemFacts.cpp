@@ -5,14 +5,15 @@
 
 #include "linux/SystemFacts.h"
 
+#include <fcntl.h>
+#include <poll.h>
 #include <unicode/datefmt.h>
 #include <unicode/locid.h>
-#include <unicode/timezone.h>
+#include <unicode/simpletz.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
-#include <fstream>
 #include <memory>
 #include <sstream>
 #include <thread>
@@ -94,29 +95,97 @@ std::string unescaped(std::string_view field) {
   return out;
 }
 
-// The file system type in one line, if that line is about "/". A line reads
-//   id parent device root MOUNT-POINT options [optional...] - TYPE source options
+struct Mount {
+  uint64_t id = 0;
+  std::string point;
+  std::string type;
+};
+
+// One line of the table, which reads
+//   ID parent device root MOUNT-POINT options [optional...] - TYPE source options
 // The number of optional fields varies, so we skip to the dash.
-std::optional<std::string> typeAtRoot(const std::string& line) {
+std::optional<Mount> mountOf(const std::string& line) {
   std::istringstream fields(line);
+  Mount mount;
   std::string field;
-  for (int i = 0; i < 5; ++i) fields >> field;
-  if (!fields || unescaped(field) != "/") return {};
+  fields >> mount.id;
+  for (int i = 0; i < 4; ++i) fields >> mount.point;
   while (fields >> field && field != "-") {
   }
-  if (!(fields >> field)) return {};
-  return unescaped(field);
+  if (!(fields >> mount.type)) return {};
+  mount.point = unescaped(mount.point);
+  mount.type = unescaped(mount.type);
+  return mount;
+}
+
+// A type that is not in this list is never touched. FUSE, 9p and virtiofs are missing because they
+// ask a program or a host for every answer. overlay is in because containers stand on it.
+constexpr std::string_view kLocalTypes[] = {
+    "bcachefs", "btrfs", "cramfs",  "erofs",   "exfat",    "ext2",  "ext3",   "ext4",
+    "f2fs",     "hfs",   "hfsplus", "iso9660", "jffs2",    "jfs",   "minix",  "msdos",
+    "nilfs2",   "ntfs3", "overlay", "ramfs",   "reiserfs", "romfs", "rootfs", "squashfs",
+    "tmpfs",    "ubifs", "udf",     "vfat",    "xfs",      "zfs"};
+static_assert(std::ranges::is_sorted(kLocalTypes));
+
+bool isLocalType(std::string_view type) { return std::ranges::binary_search(kLocalTypes, type); }
+
+// The kernel allows 100,000 mounts, whose lines have some hundred bytes each.
+constexpr size_t kMaxTableSize = size_t{32} << 20;
+
+// The id of the mount that an open file lies on. statx() knows it too, but asks the file system,
+// and a dead one would not answer. The kernel writes this file alone.
+std::optional<uint64_t> mountIdOf(int fd) {
+  constexpr std::string_view kKey = "mnt_id:";
+  const auto text = readSmallFile("/proc/self/fdinfo/" + std::to_string(fd), 4096);
+  const size_t at = text ? text->find(kKey) : std::string::npos;
+  if (at == std::string::npos) return {};
+  return std::strtoull(text->c_str() + at + kKey.size(), nullptr, 10);
 }
 
 }  // namespace
 
-std::optional<std::string> MountTable::rootFilesystemTypeName() {
-  std::ifstream table(path_);
-  std::optional<std::string> type;
-  for (std::string line; std::getline(table, line);) {
-    if (auto found = typeAtRoot(line)) type = std::move(found);
+// A machine with many containers has thousands of mounts, so the table is not read for each
+// question. The kernel marks an open table when a mount comes or goes. It counts from the moment
+// of opening, so the table is opened before it is read: a change in between is a change.
+void MountTable::refresh() {
+  pollfd table{watched_.get(), POLLPRI, 0};
+  if (watched_.valid() && ::poll(&table, 1, 0) == 0) return;
+  watched_ = UniqueFd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC));
+  typeOfMount_.clear();
+  typeAt_.clear();
+  std::istringstream lines(readSmallFile(path_, kMaxTableSize).value_or(""));
+  for (std::string line; std::getline(lines, line);) {
+    auto mount = mountOf(line);
+    if (!mount) continue;
+    typeOfMount_[mount->id] = mount->type;
+    typeAt_[mount->point] = std::move(mount->type);
   }
-  return type;
+}
+
+std::optional<std::string> MountTable::rootFilesystemTypeName() {
+  refresh();
+  const UniqueFd root(::open("/", O_PATH | O_CLOEXEC));
+  if (const auto id = mountIdOf(root.get())) {
+    if (const auto mount = typeOfMount_.find(*id); mount != typeOfMount_.end())
+      return mount->second;
+  }
+  const auto topmost = typeAt_.find("/");
+  if (topmost == typeAt_.end()) return {};
+  return topmost->second;
+}
+
+bool MountTable::mayStepOnto(const std::string& path) {
+  refresh();
+  const auto mount = typeAt_.find(path);
+  return mount == typeAt_.end() || isLocalType(mount->second);
+}
+
+bool MountTable::isLocal(int fd) {
+  refresh();
+  const auto id = mountIdOf(fd);
+  if (!id) return false;
+  const auto mount = typeOfMount_.find(*id);
+  return mount != typeOfMount_.end() && isLocalType(mount->second);
 }
 
 namespace {
@@ -129,10 +198,17 @@ std::string localeForDates() {
   return "C";
 }
 
-std::unique_ptr<icu::TimeZone> makeTimeZone(const std::optional<std::string>& name) {
-  if (!name) return std::unique_ptr<icu::TimeZone>(icu::TimeZone::detectHostTimeZone());
-  return std::unique_ptr<icu::TimeZone>(
-      icu::TimeZone::createTimeZone(icu::UnicodeString::fromUTF8(*name)));
+// ICU knows zones by their names only. TZ may hold a rule instead ("CET-1CEST,M3.5.0,M10.5.0/3"),
+// which ICU passes over in silence. The C library knows both, so it tells the offset from UTC at
+// this date, and ICU gets a zone that has this offset always.
+std::unique_ptr<icu::TimeZone> zoneAt(Date date) {
+  const time_t seconds =
+      std::chrono::system_clock::to_time_t(std::chrono::floor<std::chrono::seconds>(date));
+  tm parts{};
+  ::tzset();  // localtime_r() need not look whether the zone has changed
+  const bool known = ::localtime_r(&seconds, &parts) != nullptr;
+  const auto offset = static_cast<int32_t>(known ? parts.tm_gmtoff * 1000 : 0);
+  return std::make_unique<icu::SimpleTimeZone>(offset, icu::UnicodeString("local"));
 }
 
 // If ICU cannot read the name, the locale is bogus and formatting would fail. "C" replaces it.
@@ -143,10 +219,7 @@ icu::Locale makeLocale(const std::string& name) {
 
 }  // namespace
 
-IcuDates::IcuDates() : IcuDates(localeForDates(), {}) {}
-
-IcuDates::IcuDates(std::string locale, std::optional<std::string> timeZone)
-    : locale_(std::move(locale)), timeZone_(std::move(timeZone)) {}
+IcuDates::IcuDates() : IcuDates(localeForDates()) {}
 
 std::string IcuDates::format(Date date) {
   const auto milliseconds =
@@ -155,7 +228,7 @@ std::string IcuDates::format(Date date) {
       icu::DateFormat::kShort, icu::DateFormat::kMedium, makeLocale(locale_)));
   // ICU without its data cannot make a formatter. The seconds since 1970 are better than no date.
   if (!formatter) return std::to_string(milliseconds / 1000);
-  if (auto zone = makeTimeZone(timeZone_)) formatter->adoptTimeZone(zone.release());
+  formatter->adoptTimeZone(zoneAt(date).release());
   icu::UnicodeString text;
   formatter->format(static_cast<UDate>(milliseconds), text);
   std::string utf8;

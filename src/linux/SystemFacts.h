@@ -2,9 +2,14 @@
 
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <unordered_map>
+#include <utility>
 
+#include "os/UniqueFd.h"
 #include "platform/System.h"
 
 namespace tessel {
@@ -39,33 +44,50 @@ class OsReleaseBuildVariant final : public BuildVariant {
   const bool internal_;
 };
 
-// The mount table. Read anew for every question; any thread.
+// The kernel's mount table. It is read again when the kernel says that it changed. One thread at a
+// time.
+//
+// Local types are those of disks, of memory and of images on them. A mount of any other type may
+// belong to a server, and a server that is gone blocks whoever touches the mount, even beyond
+// SIGKILL. autofs counts as not local, because a touch can start a mount.
 class MountTable final : public Volumes {
  public:
-  // `path` names a file in the kernel's mountinfo format.
+  // `path` names a file in the kernel's mountinfo format. Only the kernel's own file tells of
+  // changes.
   explicit MountTable(std::string path = "/proc/self/mountinfo") : path_(std::move(path)) {}
 
-  // Of several mounts at "/" the topmost counts, which is the last in the table.
+  // The type of the mount that "/" belongs to by its id. If the table lacks the id, the last mount
+  // at "/" counts, which is the topmost.
   std::optional<std::string> rootFilesystemTypeName() override;
 
+  // Whether nothing but a local type is mounted right at `path`, which is absolute and has no
+  // links. Does not touch the path. The mount above it is not looked at.
+  bool mayStepOnto(const std::string& path);
+  // Whether an open file lies on a mount of a local type. Does not touch its file system.
+  bool isLocal(int fd);
+
  private:
+  void refresh();
+
   const std::string path_;
+  UniqueFd watched_;  // the open table, which the kernel marks when a mount comes or goes
+  std::unordered_map<uint64_t, std::string> typeOfMount_;  // by mount id
+  std::unordered_map<std::string, std::string> typeAt_;    // by mount point; the topmost mount's
 };
 
 // Dates in this machine's locale and time zone. Immutable; any thread.
 class IcuDates final : public DateFormatter {
  public:
-  // The locale that the environment names for dates ($LC_ALL, $LC_TIME, $LANG), and the machine's
-  // time zone at the moment of formatting.
+  // The locale that the environment names for dates ($LC_ALL, $LC_TIME, $LANG).
   IcuDates();
-  // A locale such as "de_DE.UTF-8" and a time zone such as "Europe/Berlin".
-  IcuDates(std::string locale, std::optional<std::string> timeZone);
+  // A locale such as "de_DE.UTF-8".
+  explicit IcuDates(std::string locale) : locale_(std::move(locale)) {}
 
+  // In the machine's time zone at the moment of formatting.
   std::string format(Date date) override;
 
  private:
   const std::string locale_;
-  const std::optional<std::string> timeZone_;
 };
 
 }  // namespace tessel

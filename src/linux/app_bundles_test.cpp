@@ -6,7 +6,9 @@
 #include <sys/stat.h>
 
 #include <filesystem>
+#include <fstream>
 #include <map>
+#include <sstream>
 
 #include "os/testing/TemporaryDirectory.h"
 
@@ -17,10 +19,15 @@ using testing::TemporaryDirectory;
 
 constexpr const char* kClock = "<component><id>com.vantor.Clock</id></component>";
 
+std::optional<std::string> identifierAt(const std::string& directory) {
+  MountTable mounts;
+  return AppBundles(mounts).bundleIdentifier(directory);
+}
+
 std::optional<std::string> identifierOf(const std::map<std::string, std::string>& files) {
   const TemporaryDirectory bundle;
   for (const auto& [name, text] : files) bundle.write(name, text);
-  return AppBundles().bundleIdentifier(bundle.path());
+  return identifierAt(bundle.path());
 }
 
 TEST(AppBundlesTest, TheOneMetadataFileNamesTheBundle) {
@@ -36,10 +43,10 @@ TEST(AppBundlesTest, TheOneMetadataFileNamesTheBundle) {
   EXPECT_EQ(identifierOf({{info + "x.metainfo.xml", kClock}, {info + "y.appdata.xml", kClock}}),
             std::nullopt);
   EXPECT_EQ(identifierOf({}), std::nullopt);
-  EXPECT_EQ(AppBundles().bundleIdentifier("/nowhere/Clock.AppDir"), std::nullopt);
+  EXPECT_EQ(identifierAt("/nowhere/Clock.AppDir"), std::nullopt);
 }
 
-TEST(AppBundlesTest, MetadataIsWellFormedAndHasAnId) {
+TEST(AppBundlesTest, UnusableMetadataLetsTheDesktopFileSpeak) {
   const std::string deep(100'000, '<');
   const struct {
     std::string xml;
@@ -70,7 +77,7 @@ TEST(AppBundlesTest, MetadataIsWellFormedAndHasAnId) {
   for (const auto& [xml, identifier] : kCases) {
     EXPECT_EQ(identifierOf(
                   {{"usr/share/metainfo/x.metainfo.xml", xml}, {"com.vantor.Desktop.desktop", ""}}),
-              identifier)
+              identifier.value_or("com.vantor.Desktop"))
         << xml.substr(0, 100);
   }
 }
@@ -109,16 +116,108 @@ TEST(AppBundlesTest, ALoneDesktopFileNamesTheBundle) {
             std::nullopt);
 }
 
-TEST(AppBundlesTest, OnlyFilesAndLinksToThemAreOpened) {
+TEST(AppBundlesTest, ADirectoryWithTooManyEntriesHasNoIdentifier) {
   const TemporaryDirectory bundle;
-  bundle.write("usr/share/applications/clock", "");
-  std::filesystem::create_symlink("usr/share/applications/clock",
-                                  bundle.path("com.vantor.Clock.desktop"));
-  EXPECT_EQ(AppBundles().bundleIdentifier(bundle.path()), "com.vantor.Clock");
-  // Opening a pipe that nobody writes to would wait for ever.
-  std::filesystem::create_directories(bundle.path("usr/share/metainfo"));
-  ASSERT_EQ(::mkfifo(bundle.path("usr/share/metainfo/x.metainfo.xml").c_str(), 0600), 0);
-  EXPECT_EQ(AppBundles().bundleIdentifier(bundle.path()), "com.vantor.Clock");
+  bundle.write("com.vantor.Clock.desktop", "");
+  for (int i = 1; i < 10'000; ++i) bundle.write(std::to_string(i), "");
+  EXPECT_EQ(identifierAt(bundle.path()), "com.vantor.Clock");
+  bundle.write("10000", "");
+  EXPECT_EQ(identifierAt(bundle.path()), std::nullopt);
+}
+
+TEST(AppBundlesTest, OnlyRegularFilesOfTheTreeAreOpened) {
+  const TemporaryDirectory outside;
+  outside.write("x.metainfo.xml", kClock);
+  const std::string metadata = "usr/share/metainfo/x.metainfo.xml";
+  const struct {
+    std::string target;  // of a link at `metadata`
+    bool followed;
+  } kLinks[] = {
+      {"../clock", true},
+      {"..//./../share/clock", true},
+      {"../../../usr/share/metainfo/../clock", true},
+      {"../applications/link", true},
+      {"../applications/self", false},
+      {"../missing", false},
+      {"../../../../x.metainfo.xml", false},
+      {outside.path("x.metainfo.xml"), false},
+      {"../applications", false},
+      {"../applications/pipe", false},
+  };
+  for (const auto& [target, followed] : kLinks) {
+    const TemporaryDirectory parent;
+    const std::string bundle = parent.path("Clock.AppDir");
+    parent.write("x.metainfo.xml", kClock);
+    parent.write("Clock.AppDir/com.vantor.Desktop.desktop", "");
+    parent.write("Clock.AppDir/usr/share/clock", kClock);
+    const std::string applications = bundle + "/usr/share/applications";
+    std::filesystem::create_directories(applications);
+    std::filesystem::create_directories(bundle + "/usr/share/metainfo");
+    std::filesystem::create_symlink("../clock", applications + "/link");
+    std::filesystem::create_symlink("self", applications + "/self");
+    ASSERT_EQ(::mkfifo((applications + "/pipe").c_str(), 0600), 0);
+    std::filesystem::create_symlink(target, bundle + '/' + metadata);
+    EXPECT_EQ(identifierAt(bundle), followed ? "com.vantor.Clock" : "com.vantor.Desktop") << target;
+  }
+}
+
+TEST(AppBundlesTest, LinksOnTheWayToTheBundleAreFollowed) {
+  const TemporaryDirectory directory;
+  directory.write("real/Clock.AppDir/com.vantor.Clock.desktop", "");
+  const std::string real = directory.path("real");
+  const struct {
+    std::string target;  // of "link" beside "real"
+    std::string path;
+    bool found;
+  } kWays[] = {
+      {"real", "/link/Clock.AppDir", true},
+      {real + "/", "/link/Clock.AppDir/", true},
+      {"real/../real/./Clock.AppDir", "/link/../Clock.AppDir", true},
+      {"/../../" + real, "/link/Clock.AppDir", true},
+      {"link", "/link/Clock.AppDir", false},
+      {"link/link", "/link/Clock.AppDir", false},
+      {"real", std::string("/link/Clock.AppDir\0x", 20), false},
+  };
+  for (const auto& [target, path, found] : kWays) {
+    std::filesystem::remove(directory.path("link"));
+    std::filesystem::create_symlink(target, directory.path("link"));
+    EXPECT_EQ(identifierAt(directory.path() + path).has_value(), found) << target;
+  }
+}
+
+// A table in which a mount of a server's type stands where in truth there is none. That the
+// directory is not touched cannot be seen from here, but its answer would be found if it were.
+TEST(AppBundlesTest, MountsThatAreNotLocalAreLeftAlone) {
+  const TemporaryDirectory directory;
+  directory.write("apps/Clock.AppDir/com.vantor.Clock.desktop", "");
+  std::filesystem::create_symlink("apps", directory.path("link"));
+  std::stringstream kernels;
+  kernels << std::ifstream("/proc/self/mountinfo").rdbuf();
+  const std::string apps = directory.path("apps");
+  const struct {
+    std::string mount;  // "POINT - TYPE"
+    bool found;
+  } kTables[] = {
+      {"/elsewhere rw - nfs4", true},
+      {apps + " rw - ext4", true},
+      {apps + "/Clock.AppDir/usr rw - nfs", true},
+      {apps + " rw shared:1 - nfs4", false},
+      {apps + " rw - autofs", false},
+      {apps + " rw - fuse.clock", false},
+      {apps + " rw - someday", false},
+      {apps + "/Clock.AppDir rw - 9p", false},
+      {apps + "/Clock.AppDir/com.vantor.Clock.desktop rw - fuse", false},
+      {"/ rw - nfs", true},  // its id is not that of "/"
+  };
+  for (const auto& [mount, found] : kTables) {
+    MountTable mounts(directory.write(
+        "mountinfo", kernels.str() + "900001 1 0:99 / " + mount + " server:/ rw\n"));
+    for (const char* way : {"/apps/Clock.AppDir", "/link/Clock.AppDir"})
+      EXPECT_EQ(AppBundles(mounts).bundleIdentifier(directory.path() + way).has_value(), found)
+          << mount << way;
+  }
+  MountTable none(directory.path("none"));
+  EXPECT_EQ(AppBundles(none).bundleIdentifier(apps + "/Clock.AppDir"), std::nullopt);
 }
 
 }  // namespace

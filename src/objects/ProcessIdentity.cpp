@@ -15,6 +15,9 @@ namespace {
 // one path costs. A bundle that lies further above its image is not found.
 constexpr int kExaminedDirectoriesLimit = 100;
 
+// What an entry of the cache takes beside its text: two records, a node, its share of the buckets.
+constexpr size_t kEntryBytes = 128;
+
 std::string_view withoutTrailingSeparators(std::string_view path) {
   const size_t last = path.find_last_not_of('/');
   return last == std::string_view::npos ? std::string_view() : path.substr(0, last + 1);
@@ -57,9 +60,16 @@ SharedString ProcessIdentity::bundleIdentifierForImagePath(StringRef imagePath) 
   if (!imagePath.present()) return {};
   const auto known = bundleIdentifierCache_.find(imagePath);
   if (known != bundleIdentifierCache_.end()) return known->second;
+  SharedString identifier = search(imagePath.text());
+  // Nothing makes room for a new path. If an old one went, a program with many paths could push out
+  // those of all others, and they would pay with a lookup for each object.
+  const size_t bytes = kEntryBytes + imagePath.text().size() + identifier.textOr("").size();
+  if (cacheBytes_ + bytes > kMaxCacheBytes) return identifier;
+  cacheBytes_ += bytes;
   // We remember a path without a bundle as well. Otherwise each object of its process would cost
   // another walk.
-  return bundleIdentifierCache_.emplace(imagePath, search(imagePath.text())).first->second;
+  bundleIdentifierCache_.emplace(imagePath, identifier);
+  return identifier;
 }
 
 SharedString ProcessIdentity::search(std::string_view imagePath) {

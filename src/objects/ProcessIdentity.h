@@ -3,9 +3,10 @@
 // The bundle of an image is the nearest directory above it, within 100 levels, whose name begins
 // with the image's file name and a dot. "Foo.app" is the bundle directory of ".../Foo.app/Foo".
 //
-// The object remembers every answer, also that a path has no bundle. A path therefore costs one
-// walk and at most one bundle lookup. The price: if a bundle is installed or removed later, the
-// answer for a path that was asked before stays the old one.
+// The object remembers answers, also that a path has no bundle. A remembered path costs one walk
+// and at most one bundle lookup. The price: if a bundle is installed or removed later, the answer
+// for such a path stays the old one. When kMaxCacheBytes are full, further paths get the right
+// answer too, but each time by a walk and a lookup.
 //
 // Threads: one at a time.
 
@@ -21,6 +22,9 @@ namespace tessel {
 
 class ProcessIdentity {
  public:
+  // Room for some 20,000 programs. Whoever runs programs chooses their paths, so there is a bound.
+  static constexpr size_t kMaxCacheBytes = size_t{4} << 20;
+
   explicit ProcessIdentity(BundleReader& bundles) : bundles_(bundles) {}
 
   // Absent if the image has no bundle or the path is absent. The first call for a path may read
@@ -40,6 +44,7 @@ class ProcessIdentity {
   BundleReader& bundles_;
   // Image path to identifier. An absent identifier marks a path that has none.
   std::unordered_map<SharedString, SharedString, Hash, Equal> bundleIdentifierCache_;
+  size_t cacheBytes_ = 0;
 };
 
 }  // namespace tessel

@@ -81,5 +81,23 @@ TEST_F(ProcessIdentityTest, KeepsAnswersAndLogsFinds) {
                              "Found bundle ID: \"com.vantor.Foo\" for path:\"/x/Foo.app/Foo\""});
 }
 
+TEST_F(ProcessIdentityTest, AFullCacheStillAnswers) {
+  bundles.identifiers["/x/Foo.app"] = "com.vantor.Foo";
+  const std::string deep(4000, 'd');
+  const auto asked = [&](const std::string& path) {
+    bundles.asked.clear();
+    EXPECT_EQ(lookUp(path), "com.vantor.Foo");
+    return bundles.asked.size();
+  };
+  asked("/x/Foo.app/first/Foo");
+  for (int i = 0; i < 2000; ++i) lookUp("/x/Bar.app/" + std::to_string(i) + deep + "/Bar");
+  EXPECT_EQ(asked("/x/Foo.app/first/Foo"), 0u);
+  // Short paths have room for longer, but not without end.
+  for (int i = 0; i < 100'000; ++i) lookUp("/" + std::to_string(i));
+  EXPECT_EQ(asked("/x/Foo.app/last/Foo"), 1u);
+  EXPECT_EQ(asked("/x/Foo.app/last/Foo"), 1u);
+  EXPECT_EQ(asked("/x/Foo.app/first/Foo"), 0u);
+}
+
 }  // namespace
 }  // namespace tessel

@@ -81,8 +81,8 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
                           ServiceStatus& status) {
   auto& throttle = keep<Throttle>(clock);
   auto& road = keep<EventRoad>(throttle, spool, reportingQueue);
-  auto& identity = keep<ProcessIdentity>(keep<AppBundles>());
   auto& volumes = keep<MountTable>();
+  auto& identity = keep<ProcessIdentity>(keep<AppBundles>(volumes));
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   const auto makeExtractor = [store = launch.traceStore, &status] {
     // The poll of a past run keeps a weak reference. make_shared() puts the object and its counter

@@ -57,8 +57,8 @@ class PayloadBuilder {
   }
 
  private:
-  AppBundles bundles_;
   MountTable volumes_;
+  AppBundles bundles_{volumes_};
   ProcessIdentity identity_;
   const BootVolumeFacts bootVolume_;
 };
