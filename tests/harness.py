@@ -1,7 +1,8 @@
 """Shared by the whole-service tests: makes stores, and runs the programs apart from this machine.
 
-The service's run marker has a fixed path under /var/tmp. Each Machine gives its programs another
-/var/tmp through a mount namespace. So tests can run side by side, and beside an installed service.
+The service's run marker has a fixed path under /var/tmp, and the unit's lies in a directory under /var/lib. Each
+Machine gives its programs others through a mount namespace. So tests can run side by side, and beside an installed
+service.
 """
 import contextlib
 import json
@@ -80,9 +81,10 @@ def export_bytes(entries, now, first_sequence=1):
         yield b"".join(_field(key, value) for key, value in fields) + b"\n"
 
 
-def in_namespace_argv(var_tmp, command, read_only=()):
+def in_namespace_argv(var_tmp, command, read_only=(), var_lib=None):
     # -n: otherwise mount makes /run/mount, on the machine itself.
     script = 'mount -n --bind "$0" /var/tmp && '
+    script += f"mount -n --bind {var_lib} /var/lib && " if var_lib else ""
     script += "".join(f"mount -n --bind {path} {path} && mount -n -o remount,bind,ro {path} && " for path in read_only)
     script += 'exec "$@"'
     unshare = ["unshare", "--mount"] if os.geteuid() == 0 else ["unshare", "--user", "--map-root-user", "--mount"]
@@ -94,9 +96,9 @@ class Machine:
 
     def __init__(self):
         self.root = tempfile.mkdtemp(prefix="tessel-test-")
-        self.store, self.state, self.config, self.var_tmp = (
-            os.path.join(self.root, name) for name in ("store", "state", "config", "var_tmp"))
-        for folder in (self.store, self.state, self.config, self.var_tmp):
+        folders = [os.path.join(self.root, name) for name in ("store", "state", "config", "var_tmp", "var_lib")]
+        self.store, self.state, self.config, self.var_tmp, self.var_lib = folders
+        for folder in folders:
             os.mkdir(folder)
         self.read_only = []  # directories that the programs cannot write to, whoever runs them
         self.now = time.time()
@@ -145,7 +147,8 @@ class Machine:
 
     def start(self, program="tessel_reporter", *arguments, **extra):
         """Starts a program; what it prints goes to files that result() reads."""
-        command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments], self.read_only)
+        command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments], self.read_only,
+                                    self.var_lib)
         output = tempfile.TemporaryFile()
         errors = tempfile.TemporaryFile()
         process = subprocess.Popen(command, env=self.environment(**extra), stdout=output, stderr=errors,

@@ -343,16 +343,42 @@ class Status(CtlTest):
     def test_it_says_what_the_next_run_will_meet(self):
         self.machine.write_export([log_event("old", at=-90000), log_event("new")])
         self.assertEqual(self.status()[1]["deferral"], {"wanted": False})
-        self.assertFalse(self.status()[1]["marker"]["present"])
         self.assertTrue(self.status()[1]["journal"]["keeps_a_day"])
         self.assertEqual(self.machine.ctl("defer", "on").status, 0)
-        open(os.path.join(self.machine.var_tmp, harness.MARKER), "w", encoding="utf-8").close()
         self.machine.write_export([log_event("new")])
         status = self.status()[1]
         self.assertTrue(status["deferral"]["wanted"])
         self.assertIn("/defer", status["deferral"]["reason"])
-        self.assertTrue(status["marker"]["present"])
         self.assertFalse(status["journal"]["keeps_a_day"])
+
+    def markers(self):
+        marker = self.status()[1]["marker"]
+        return marker["present"], marker.get("owner"), [(place["of"], place["state"]) for place in marker["places"]]
+
+    def test_markers_of_the_unit_and_of_a_run_by_hand(self):
+        harness.require_root()
+        self.assertEqual(self.markers(), (False, None, [("by_hand", "absent")]))
+        directory = os.path.join(self.machine.var_lib, "tessel-marker")
+        os.mkdir(directory, 0o700)
+        by_hand = os.path.join(self.machine.var_tmp, harness.MARKER)
+        os.symlink("/nowhere", by_hand)
+        os.chown(by_hand, 54321, 54321, follow_symlinks=False)
+        self.assertEqual(self.markers(), (True, "54321", [("unit", "absent"), ("by_hand", "present")]))
+        shown = self.machine.ctl("status").out
+        self.assertRegex(shown, r"Marker +none +no run under the unit is reporting")
+        self.assertRegex(shown, r"Marker +present +/var/tmp/tessel_reporter_running of 54321")
+        open(os.path.join(directory, harness.MARKER), "w", encoding="utf-8").close()
+        self.assertEqual(self.markers(), (True, "root", [("unit", "present"), ("by_hand", "present")]))
+        os.unlink(by_hand)
+        self.assertRegex(self.machine.ctl("status").out, r"Marker +present +/var/lib/tessel-marker/tessel_reporter_running of root")
+        for folder in (self.machine.root, self.machine.state):
+            os.chmod(folder, 0o755)
+        nobody = ["setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", os.path.join(BIN, "tesselctl"), "status"]
+        for arguments, said in (([], "tessel_reporter_running cannot be seen"), (["--json"], '"state":"cannot_be_seen"')):
+            result = subprocess.run(
+                harness.in_namespace_argv(self.machine.var_tmp, nobody + arguments, var_lib=self.machine.var_lib),
+                env=self.machine.environment(), capture_output=True, text=True, check=False)
+            self.assertIn(said, re.sub(r"\s+", " ", result.stdout), result.stderr)
 
 
 if __name__ == "__main__":

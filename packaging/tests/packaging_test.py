@@ -69,10 +69,8 @@ class Units(unittest.TestCase):
         unit = settings(REPORTER)
         for setting in ("DynamicUser", "PrivateTmp"):
             self.assertNotIn("yes", unit.get(setting, []), setting)
+        self.assertEqual(unit["BindPaths"], ["/var/lib/tessel-marker:/var/tmp"])
         self.assertNotIn("pid", unit.get("ProcSubset", []))
-        with open(os.path.join(SYSTEMD, "tessel-reporter.tmpfiles"), encoding="utf-8") as lines:
-            self.assertIn("x", [line.split()[0] for line in lines
-                                if "/var/tmp/tessel_reporter_running" in line])
 
     def test_life_of_the_service(self):
         unit = settings(REPORTER)
@@ -114,6 +112,78 @@ class Accounts(unittest.TestCase):
                 members = dict((line.split(":")[0], line.rstrip("\n").split(":")[3]) for line in group)
             self.assertEqual(members["systemd-journal"], "tessel-reporter")
             self.assertEqual(members["tessel-reporter"], "statora-forwarder")
+            with open(os.path.join(root, "etc", "passwd"), encoding="utf-8") as users:
+                service = [int(user.split(":")[2]) for user in users if user.startswith("tessel-reporter:")]
+            marker = os.stat(os.path.join(root, "var", "lib", "tessel-marker"))
+            self.assertEqual(([marker.st_uid], marker.st_mode & 0o7777), (service, 0o700))
+
+
+class MaintainerScripts(unittest.TestCase):
+    """The scripts of the package, run as root in a mount namespace with other directories and stand-ins for the
+    programs that would change this machine. Those that look for the marker and move it are the real ones."""
+
+    SERVICE, STRANGER = 54321, 65534
+    STAND_INS = {"systemctl": 'case "$*" in *ActiveState*) echo "$ACTIVE_STATE" ;; esac',
+                 "systemd-tmpfiles": f"mkdir -p -m 700 /var/lib/tessel-marker && chown {SERVICE}:{SERVICE} /var/lib/tessel-marker",
+                 **dict.fromkeys(("systemd-sysusers", "deb-systemd-helper", "deb-systemd-invoke", "journalctl",
+                                  "userdel", "groupdel"), "true")}
+    SERVICE_FILE = (SERVICE, "file")
+    OTHERS = ((STRANGER, "file"), (SERVICE, "link"), (SERVICE, "directory"), (SERVICE, "fifo"))
+
+    def setUp(self):
+        self.assertEqual(os.geteuid(), 0, "only root can play other users; leave this out with -LE root")
+
+    def lay_out(self, root, marker):
+        for folder in ("etc", "run/systemd/system", "var/lib", "var/tmp", "bin"):
+            os.makedirs(os.path.join(root, folder))
+        os.chmod(os.path.join(root, "var/tmp"), 0o1777)
+        for name, text in (("passwd", "tessel-reporter:x:%d:%d::/:/bin/false"), ("group", "tessel-reporter:x:%d:")):
+            with open(os.path.join(root, "etc", name), "w", encoding="utf-8") as file:
+                file.write("root:x:0:0::/root:/bin/sh\n" * (name == "passwd") + text % ((self.SERVICE,) * text.count("%")) + "\n")
+        for name, text in self.STAND_INS.items():
+            with open(os.path.join(root, "bin", name), "w", encoding="utf-8") as file:
+                file.write("#!/bin/sh\n" + text + "\n")
+            os.chmod(file.name, 0o755)
+        owner, kind = marker
+        path = os.path.join(root, "var/tmp/tessel_reporter_running")
+        victim = os.path.join(root, "var/tmp/victim")
+        for file in [victim] + [path] * (kind == "file"):
+            os.close(os.open(file, os.O_CREAT, 0o644))
+            os.chown(file, self.SERVICE, self.SERVICE)
+        {"file": lambda: os.utime(path, (1, 1)), "link": lambda: os.symlink("victim", path),
+         "directory": lambda: os.mkdir(path), "fifo": lambda: os.mkfifo(path)}[kind]()
+        os.chown(path, owner, owner, follow_symlinks=False)
+
+    def after(self, marker, script, *arguments, active="inactive", installed=False):
+        """(whether the shared marker is there, the marker in the directory of the unit) after the script."""
+        with tempfile.TemporaryDirectory() as root:
+            self.lay_out(root, marker)
+            if installed:
+                os.mkdir(os.path.join(root, "var/lib/tessel-marker"))
+            binds = "".join(f"mount -n --bind {root}/{folder} /{folder} && " for folder in ("etc", "run", "var/lib", "var/tmp"))
+            result = run("unshare", "--mount", "sh", "-c", binds + 'exec sh "$@"', "sh",
+                         os.path.join(PACKAGING, "debian", "tessel-reporter." + script), *arguments,
+                         env={"PATH": f"{root}/bin:/usr/sbin:/usr/bin:/sbin:/bin", "ACTIVE_STATE": active})
+            self.assertEqual(result.returncode, 0, result.stderr)
+            self.assertTrue(os.path.exists(os.path.join(root, "var/tmp/victim")))
+            self.assertEqual(os.path.isdir(os.path.join(root, "var/lib/tessel-marker")), script == "postinst")
+            brought = os.path.join(root, "var/lib/tessel-marker/tessel_reporter_running")
+            facts = os.lstat(brought) if os.path.lexists(brought) else None
+            return (os.path.lexists(os.path.join(root, "var/tmp/tessel_reporter_running")),
+                    facts and (facts.st_uid, facts.st_mode, facts.st_mtime))
+
+    def test_an_upgrade_brings_the_marker_once(self):
+        upgrade = ("postinst", "configure", "0.0.1")
+        self.assertEqual(self.after(self.SERVICE_FILE, *upgrade), (False, (self.SERVICE, 0o100660, 1)))
+        for active in ("active", "activating", "deactivating"):
+            self.assertEqual(self.after(self.SERVICE_FILE, *upgrade, active=active), (True, None), active)
+        self.assertEqual(self.after(self.SERVICE_FILE, *upgrade, installed=True), (True, None))
+        for marker in self.OTHERS:
+            self.assertEqual(self.after(marker, *upgrade), (True, None), marker)
+
+    def test_a_purge_removes_the_file_of_the_service_alone(self):
+        for marker in (self.SERVICE_FILE,) + self.OTHERS:
+            self.assertEqual(self.after(marker, "postrm", "purge", installed=True), (marker != self.SERVICE_FILE, None), marker)
 
 
 class Texts(unittest.TestCase):
@@ -162,7 +232,7 @@ class Texts(unittest.TestCase):
                 with open(path, "rb") as script:
                     scripts += [path] if re.match(rb"#!/bin/(sh|bash)\b", script.readline()) else []
         self.assertIn(os.path.join(ROOT, ".ci", "run"), scripts)
-        result = run("shellcheck", *scripts)
+        result = run("shellcheck", "--external-sources", "--source-path=" + ROOT, *scripts)
         self.assertEqual((result.returncode, result.stdout), (0, ""))
 
 

@@ -6,11 +6,12 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <functional>
 
 #include "os/Files.h"
 #include "platform/Text.h"
-#include "service/ReportingRun.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/showing/Losses.h"
@@ -55,6 +56,23 @@ void writeSpool(JsonWriter& json, const ReporterStatus& status) {
   }
 }
 
+// The first marker that is present speaks for the object, and `places` tells of each place.
+void writeMarkers(JsonWriter& json, const std::vector<Marker>& markers) {
+  const auto owned = [&json](const Marker& marker) {
+    if (marker.present()) json.member("owner", marker.owner).member("since", marker.since);
+  };
+  const auto first = std::find_if(markers.begin(), markers.end(), std::mem_fn(&Marker::present));
+  json.member("present", first != markers.end());
+  if (first != markers.end()) owned(*first);
+  json.array("places", markers, [&](const Marker& marker) {
+    json.object([&] {
+      json.member("of", markerOfName(marker.of)).member("path", marker.path);
+      json.member("state", markerStateName(marker.state));
+      owned(marker);
+    });
+  });
+}
+
 void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("delivered", counters.delivered).member("rejected", counters.rejected);
   json.member("set_aside", counters.setAside);
@@ -77,11 +95,7 @@ std::string statusJson(const ReporterStatus& status) {
     json.object("deferral", [&] {
       json.member("wanted", status.deferral.has_value()).member("reason", status.deferral);
     });
-    json.object("marker", [&] {
-      json.member("present", status.marker.present);
-      if (status.marker.present)
-        json.member("owner", status.marker.owner).member("since", status.marker.since);
-    });
+    json.object("marker", [&] { writeMarkers(json, status.markers); });
     if (status.run)
       json.object("last_run", [&] { writeRun(json, *status.run, status.hasBooks()); });
     json.member("last_begin", status.lastBegin);
@@ -110,7 +124,7 @@ class Screen {
          status_.deferral ? Colour::caution : Colour::plain,
          status_.deferral.value_or("nothing speaks against a run now"));
     lastRun();
-    marker();
+    for (const Marker& each : status_.markers) marker(each);
     spool();
     if (status_.spool.forwarder) forwarder(*status_.spool.forwarder);
     journal();
@@ -215,15 +229,25 @@ class Screen {
 
   // The file alone does not tell a run at work from one that died. We say both and give the age of
   // the file, from which a reader can tell.
-  void marker() {
-    if (!status_.marker.present) {
-      line("Marker", "none", Colour::plain, "no run is reporting, and none died");
-      return;
+  void marker(const Marker& marker) {
+    const bool ofUnit = marker.of == MarkerOf::unit;
+    const std::string run = ofUnit ? "run under the unit" : "run by hand";
+    switch (marker.state) {
+      case Marker::State::absent:
+        // On a machine with the unit, few run the service by hand. We spare those a line.
+        if (ofUnit || status_.markers.size() == 1)
+          line("Marker", "none", Colour::plain, "no " + run + " is reporting, and none died");
+        return;
+      case Marker::State::present:
+        line("Marker", "present", Colour::caution,
+             marker.path + " of " + marker.owner + ", since " + since(marker.since) + ": a " + run +
+                 " is reporting, or died; then the next one only removes it");
+        return;
+      case Marker::State::cannotBeSeen:
+        line("Marker", "unknown", Colour::caution,
+             marker.path + " cannot be seen; root may look whether a " + run + " died");
+        return;
     }
-    line("Marker", "present", Colour::caution,
-         std::string(cookieFilePath) + " of " + status_.marker.owner + ", since " +
-             since(status_.marker.since) +
-             ": a run is reporting, or died; then the next one only removes it");
   }
 
   // An absent spool is plain, because a machine that was never tasked has none. Only a damaged one

@@ -8,6 +8,8 @@
 #include <pwd.h>
 #include <sys/stat.h>
 
+#include <cerrno>
+#include <filesystem>
 #include <memory>
 
 #include "journal/JournalStore.h"
@@ -21,17 +23,39 @@ namespace tessel::ctl {
 
 namespace {
 
-Marker lookForMarker() {
+// The unit binds this directory over /var/tmp. Only the service's user and root may look into it.
+constexpr char kUnitMarkerDirectory[] = "/var/lib/tessel-marker";
+
+Marker lookForMarker(MarkerOf of, std::string path) {
   struct stat facts {};
   Marker marker;
+  marker.of = of;
+  marker.path = std::move(path);
   // The service takes anything of that name for a marker, so a broken link counts too.
-  if (::lstat(cookieFilePath, &facts) != 0) return marker;
-  marker.present = true;
+  if (::lstat(marker.path.c_str(), &facts) != 0) {
+    // After any error but these two a marker may still be there.
+    if (errno != ENOENT && errno != ENOTDIR) marker.state = Marker::State::cannotBeSeen;
+    return marker;
+  }
+  marker.state = Marker::State::present;
   marker.since = Date{std::chrono::seconds{facts.st_mtim.tv_sec}};
   // The user may be gone: a number still tells who made the marker.
   const passwd* user = ::getpwuid(facts.st_uid);
   marker.owner = user != nullptr ? user->pw_name : std::to_string(facts.st_uid);
   return marker;
+}
+
+std::vector<Marker> lookForMarkers() {
+  std::vector<Marker> markers;
+  // The package makes the directory, and the unit does not start without it. So a machine without
+  // the directory has no run under the unit.
+  struct stat facts {};
+  if (::lstat(kUnitMarkerDirectory, &facts) == 0) {
+    const std::string name = std::filesystem::path(cookieFilePath).filename();
+    markers.push_back(lookForMarker(MarkerOf::unit, kUnitMarkerDirectory + ("/" + name)));
+  }
+  markers.push_back(lookForMarker(MarkerOf::runByHand, cookieFilePath));
+  return markers;
 }
 
 JournalFacts lookAtJournal(const std::optional<std::string>& store) {
@@ -55,6 +79,20 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
 
 }  // namespace
 
+std::string_view markerOfName(MarkerOf kind) { return kind == MarkerOf::unit ? "unit" : "by_hand"; }
+
+std::string_view markerStateName(Marker::State state) {
+  switch (state) {
+    case Marker::State::absent:
+      return "absent";
+    case Marker::State::present:
+      return "present";
+    case Marker::State::cannotBeSeen:
+      break;
+  }
+  return "cannot_be_seen";
+}
+
 ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   const StateDirectory state = StateDirectory::forReading(launch.stateDirectory);
   ReporterStatus status;
@@ -62,7 +100,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   status.tasking = askTasking(launch);
   status.taskingWords = taskingWords(status.tasking, launch);
   status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
-  status.marker = lookForMarker();
+  status.markers = lookForMarkers();
   status.run = readRunRecord(launch.stateDirectory);
   status.lastBegin = state.lastRun();
   SpoolReader spool(launch.stateDirectory);

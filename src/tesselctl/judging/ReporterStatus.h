@@ -8,6 +8,8 @@
 #include <chrono>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <vector>
 
 #include "linux/LaunchConfiguration.h"
 #include "objects/RunRecord.h"
@@ -17,12 +19,26 @@
 
 namespace tessel::ctl {
 
-// The file that a run leaves while it reports.
+// The unit shows its runs a directory of their own as /var/tmp, where a run keeps its marker. So a
+// run under the unit and a run by hand do not see each other's marker.
+enum class MarkerOf { unit, runByHand };
+// Names for JSON: "unit", "by_hand".
+std::string_view markerOfName(MarkerOf kind);
+
+// The file that a run leaves while it reports, at one of its two places.
 struct Marker {
-  bool present = false;
-  std::string owner;
-  Date since{};
+  enum class State { absent, present, cannotBeSeen };
+
+  MarkerOf of = MarkerOf::runByHand;
+  std::string path;  // of the file, there or not
+  State state = State::absent;
+  std::string owner;  // if present
+  Date since{};       // if present
+
+  bool present() const { return state == State::present; }
 };
+// Names for JSON: "absent", "present", "cannot_be_seen".
+std::string_view markerStateName(Marker::State state);
 
 struct JournalFacts {
   std::optional<Date> oldest;            // entry; absent where the store has none
@@ -34,7 +50,8 @@ struct ReporterStatus {
   Tasking tasking;
   std::string taskingWords;
   std::optional<std::string> deferral;  // why one is wanted
-  Marker marker;
+  // The unit's first, if this machine has its directory; then that of a run by hand.
+  std::vector<Marker> markers;
   std::optional<RunRecord> run;
   // The begin of the last run that came to its end and was not deferred. The scheduler notes it.
   std::optional<Date> lastBegin;
