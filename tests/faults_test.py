@@ -247,7 +247,7 @@ class Permission(MachineTest):
             os.chmod(os.path.join(self.machine.store, f"{number}.export"), 0o644 if number % 2 else 0o600)
         os.chmod(self.machine.root, 0o755)
         for folder in (self.machine.state, self.machine.var_tmp):
-            os.chmod(folder, 0o777)
+            os.chown(folder, 65534, 65534)
         command = ["setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", os.path.join(BIN, "tessel_reporter")]
         result = subprocess.run(in_namespace_argv(self.machine.var_tmp, command), env=self.machine.environment(),
                                 capture_output=True, text=True, timeout=120, check=False)

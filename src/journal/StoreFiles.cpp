@@ -4,7 +4,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -138,16 +137,6 @@ StoreFiles Finder::take() {
   return std::move(found_);
 }
 
-// Every file of the store stays open. The usual soft limit of 1,024 protects programs that use
-// select(); we do not, so we raise it.
-void allowOpenFiles(size_t count) {
-  // Failing is no error: the files that cannot be opened are then reported one by one.
-  rlimit limit{};
-  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= count) return;
-  limit.rlim_cur = std::min<rlim_t>(count, limit.rlim_max);
-  ::setrlimit(RLIMIT_NOFILE, &limit);
-}
-
 PlatformError storeError(const std::string& path, int error) {
   return {codeOf(error), path + ": " + whyNotOpened(error)};
 }
@@ -184,8 +173,12 @@ std::string whyNotOpened(int error) {
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
                                                        size_t limit, const StopFlag& stop) {
   constexpr size_t kOtherFiles = 256;  // descriptors for everything else in the process
-  allowOpenFiles(limit + kOtherFiles);
-  Finder finder(limit, stop);
+  // Every file of the store stays open. The usual soft limit of 1,024 protects programs that use
+  // select(); we do not, so we raise it. Where the hard limit is too low, we look at fewer files.
+  // If the store took every descriptor, the spool could not be opened and all rows would be lost.
+  const size_t allowed = allowDescriptors(limit + kOtherFiles);
+  const size_t forStore = allowed > 2 * kOtherFiles ? allowed - kOtherFiles : allowed / 2;
+  Finder finder(std::min(limit, forStore), stop);
   if (!path) return machineJournal(finder);
   struct stat status {};
   if (::stat(path->c_str(), &status) != 0) return storeError(*path, errno);

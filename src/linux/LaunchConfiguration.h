@@ -18,6 +18,7 @@ namespace tessel {
 // Exit statuses of the service besides 0, as in sysexits.h.
 inline constexpr int kExitConfiguration = 78;   // a launch variable has an invalid value
 inline constexpr int kExitStateDirectory = 73;  // the state directory cannot be used
+inline constexpr int kExitDescriptors = 71;     // the process may not open enough files
 
 // What may defer a run.
 struct DeferSources {

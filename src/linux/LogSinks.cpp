@@ -34,6 +34,7 @@ constexpr struct {
     {"Not reporting ", "aab21dd8ab154e9e9b6bcf90786745c9"},
     {"Trying to stop in-flight reporting work.", "028e77c9a30243d590fb466bdd747234"},
     {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
+    {"A file in the state directory is not used: ", "dc9f4449558a4b44b8db8d735db6a79b"},
     {"The record of the run is not written: ", "5ec5b861dea7400ab6f514dfd29986f8"},
 };
 

@@ -20,18 +20,11 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-// Our records have a sixteenth of this at most, so a larger one of a later service can still be
-// read. The bound keeps a file that somebody else put there from filling the memory.
-constexpr size_t kMaxRecordBytes = size_t{1} << 20;
 constexpr size_t kMaxFailureBytes = 1024;
 // Losses of three codes (skipped files, damage, dropped entries) vary without bound, so each of
 // these codes may list 17. JSON escapes double a text at most. So 51 losses with two such texts
 // each take 60 KiB with their keys.
 constexpr size_t kMaxTextBytes = 256;
-
-std::string recordPath(const std::string& stateDirectory) {
-  return stateDirectory + "/last_run.json";
-}
 
 Date dateAt(const Json& json, const char* key) {
   return Date{std::chrono::microseconds{json.at(key).get<int64_t>()}};
@@ -125,6 +118,10 @@ RunRecord recordFrom(const Json& json) {
 
 }  // namespace
 
+std::string runRecordPath(const std::string& stateDirectory) {
+  return stateDirectory + "/last_run.json";
+}
+
 std::optional<PlatformError> writeRunRecord(const RunRecord& record,
                                             const std::string& stateDirectory) {
   // A run that was not tasked read nothing, so it must not replace the record of a run that did.
@@ -146,12 +143,13 @@ std::optional<PlatformError> writeRunRecord(const RunRecord& record,
     json.array("set_aside", record.setAside, [&](const std::string& name) { json.value(name); });
     json.member("marker", record.marker);
   });
-  return replaceFileDurably(recordPath(stateDirectory), text + "\n");
+  return replaceFileDurably(runRecordPath(stateDirectory), text + "\n");
 }
 
 std::optional<RunRecord> readRunRecord(const std::string& stateDirectory) {
-  const auto text = readSmallFile(recordPath(stateDirectory), kMaxRecordBytes);
-  if (!text) return {};
+  const auto content = readOwnFile(runRecordPath(stateDirectory), kMaxRunRecordBytes);
+  const auto* text = std::get_if<std::string>(&content);
+  if (text == nullptr) return {};
   try {
     return recordFrom(Json::parse(*text));
   } catch (const nlohmann::json::exception&) {

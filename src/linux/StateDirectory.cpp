@@ -4,8 +4,7 @@
 // marker that cannot be removed would stop all later runs. So we remove a directory with its whole
 // content. The service may run as root, so nobody may lead this walk to other files:
 //  - It goes from descriptor to descriptor (openat with O_NOFOLLOW), never by path. So it follows
-//  no
-//    link, even one that somebody puts there between two steps.
+//    no link, even one that somebody puts there between two steps.
 //  - It enters no other mount: it must not empty a file system that is mounted below the marker.
 //  - Its depth is bounded, because each level holds a descriptor.
 // std::filesystem::remove_all was discarded: it crosses mounts.
@@ -25,7 +24,9 @@
 #include <string>
 #include <system_error>
 #include <tuple>
+#include <utility>
 
+#include "linux/RunRecordFile.h"
 #include "os/Files.h"
 #include "platform/Text.h"
 
@@ -57,11 +58,20 @@ int makeDirectory(const std::string& path) {
 
 }  // namespace
 
-std::variant<StateDirectory, std::string> StateDirectory::open(const std::string& path) {
+// A run as another user, which only root can do, would leave files that all later runs of the owner
+// cannot write: the rows of those runs would be lost without end.
+std::variant<StateDirectory, PlatformError> StateDirectory::open(const std::string& path) {
   const std::string plain = withoutTrailingSlashes(path);
-  const std::string shown = "state directory " + plainText(plain, "\\x0a") + ": ";
-  if (const int error = makeDirectory(plain)) return shown + errorWords(error);
-  if (!openDirectory(plain).valid()) return shown + errorWords(errno);
+  const std::string shown = "state directory " + plainText(plain, "\\x0a");
+  if (const int error = makeDirectory(plain)) return fileError(shown, error);
+  const UniqueFd directory = openDirectory(plain);
+  struct stat facts {};
+  if (!directory.valid() || ::fstat(directory.get(), &facts) != 0) return fileError(shown, errno);
+  if (facts.st_uid != ::geteuid()) {
+    return PlatformError{ErrorCode::noAccess,
+                         shown + ": it belongs to user " + std::to_string(facts.st_uid) +
+                             ", and this process runs as user " + std::to_string(::geteuid())};
+  }
   return StateDirectory(plain);
 }
 
@@ -80,14 +90,28 @@ std::optional<RunLock> StateDirectory::tryLock() const { return lock(LOCK_EX | L
 std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX); }
 
 std::optional<Date> StateDirectory::lastRun() const {
-  const std::optional<std::string> text = readSmallFile(recordFile(), kMaxRecordSize);
+  const auto content = readOwnFile(recordFile(), kMaxRecordSize);
+  const auto* text = std::get_if<std::string>(&content);
   // A record without its line feed was cut short, so its number may be incomplete.
-  if (!text || !text->ends_with('\n')) return {};
+  if (text == nullptr || !text->ends_with('\n')) return {};
   int64_t microseconds = 0;
   const char* end = text->data() + text->size() - 1;
   const auto [stopped, error] = std::from_chars(text->data(), end, microseconds);
   if (error != std::errc() || stopped != end || microseconds < 0) return {};
   return Date(std::chrono::microseconds{microseconds});
+}
+
+std::vector<PlatformError> StateDirectory::refusedFiles() const {
+  std::vector<PlatformError> refused;
+  const std::pair<std::string, size_t> kFiles[] = {{recordFile(), kMaxRecordSize},
+                                                   {runRecordPath(path_), kMaxRunRecordBytes}};
+  for (const auto& [path, maximum] : kFiles) {
+    auto content = readOwnFile(path, maximum);
+    auto* error = std::get_if<PlatformError>(&content);
+    if (error != nullptr && error->code != ErrorCode::notFound)
+      refused.push_back(std::move(*error));
+  }
+  return refused;
 }
 
 std::optional<PlatformError> StateDirectory::recordRun(Date begin) const {
@@ -124,11 +148,11 @@ class Remover {
     // Remove it as a file first. If we looked before, it could become something else in between.
     if (::unlinkat(parent, name, 0) == 0) return true;
     const int error = errno;
-    if (!isDirectory(parent, name)) return failed(path, errorWords(error));
+    if (!isDirectory(parent, name)) return failed(fileError(path, error));
     if (!removeContents(parent, name, path, depth)) return false;
-    return ::unlinkat(parent, name, AT_REMOVEDIR) == 0 || failed(path, errorWords(errno));
+    return ::unlinkat(parent, name, AT_REMOVEDIR) == 0 || failed(fileError(path, errno));
   }
-  const std::string& error() const { return error_; }
+  const std::optional<PlatformError>& error() const { return error_; }
 
  private:
   static bool isDirectory(int parent, const char* name) {
@@ -137,12 +161,14 @@ class Remover {
   }
 
   bool removeContents(int parent, const char* name, const std::string& path, int depth) {
-    if (depth == LocalFiles::kMaxRemovalDepth) return failed(path, "nested too deeply");
+    if (depth == LocalFiles::kMaxRemovalDepth)
+      return failed({ErrorCode::failed, path + ": nested too deeply"});
     UniqueFd fd(::openat(parent, name, kOpenDirectory));
-    if (!fd.valid()) return failed(path, errorWords(errno));
-    if (mountOf(fd.get()) != mount_) return failed(path, "something is mounted here");
+    if (!fd.valid()) return failed(fileError(path, errno));
+    if (mountOf(fd.get()) != mount_)
+      return failed({ErrorCode::failed, path + ": something is mounted here"});
     const Directory directory(::fdopendir(fd.get()));
-    if (!directory) return failed(path, errorWords(errno));
+    if (!directory) return failed(fileError(path, errno));
     const int inside = fd.release();  // closedir() closes it
     bool removedAll = true;
     while (const dirent* entry = ::readdir(directory.get())) {
@@ -154,13 +180,13 @@ class Remover {
     return removedAll;
   }
 
-  bool failed(const std::string& path, const std::string& why) {
-    if (error_.empty()) error_ = path + ": " + why;
+  bool failed(PlatformError error) {
+    if (!error_) error_ = std::move(error);
     return false;
   }
 
   const MountKey mount_;
-  std::string error_;
+  std::optional<PlatformError> error_;
 };
 
 }  // namespace
@@ -176,10 +202,13 @@ bool LocalFiles::createFile(const std::string& path) { return createNewFile(path
 
 RemovalResult LocalFiles::remove(const std::string& path) {
   const std::filesystem::path whole(path);
+  // A marker is a file nearly always, and removing a file takes no descriptor. So a process that
+  // has run out of descriptors still removes its marker.
+  if (::unlink(path.c_str()) == 0) return {true, {}};
   const std::string parentPath = whole.has_parent_path() ? whole.parent_path().string() : ".";
   const UniqueFd parent = openDirectory(parentPath);
   const std::optional<MountKey> mount = parent.valid() ? mountOf(parent.get()) : std::nullopt;
-  if (!mount) return {false, parentPath + ": " + errorWords(errno)};
+  if (!mount) return {false, fileError(parentPath, errno)};
   Remover remover(*mount);
   if (remover.remove(parent.get(), whole.filename().c_str(), path, 0)) return {true, {}};
   return {false, remover.error()};

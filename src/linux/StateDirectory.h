@@ -6,6 +6,7 @@
 #include <string>
 #include <utility>
 #include <variant>
+#include <vector>
 
 #include "os/UniqueFd.h"
 #include "platform/Error.h"
@@ -29,13 +30,18 @@ class RunLock {
 //                       it.
 //   defer               other programs make and remove it; while it exists, runs are deferred
 //
+// A file that the service reads here is a regular file of the directory's owner. Anything else
+// under its name counts as no file; refusedFiles() says why. The next write puts our own file
+// there.
+//
 // The service also runs with a directory that it cannot write. A run then loses its record and its
 // events, and the log says so. Immutable; any thread may use it.
 class StateDirectory {
  public:
   // Makes the directory (mode 0750) if it is missing. The error is one line that names the
-  // directory and the reason: it cannot be made, is no directory, or cannot be read.
-  static std::variant<StateDirectory, std::string> open(const std::string& path);
+  // directory and the reason: it cannot be made, is no directory, cannot be read, or belongs to
+  // another user than this process runs as. Then nothing in it has been touched.
+  static std::variant<StateDirectory, PlatformError> open(const std::string& path);
   // The directory for those who only look. Makes nothing.
   static StateDirectory forReading(std::string path) { return StateDirectory(std::move(path)); }
 
@@ -49,6 +55,8 @@ class StateDirectory {
 
   // When the last run began. Absent if there is no record or it cannot be understood.
   std::optional<Date> lastRun() const;
+  // The files of the service that are there and are not used, each with the reason.
+  std::vector<PlatformError> refusedFiles() const;
   // Records a run. The error is absent if that succeeded; replaceFileDurably() says which record
   // stands after an error. REQUIRES: the caller holds the lock.
   std::optional<PlatformError> recordRun(Date begin) const;

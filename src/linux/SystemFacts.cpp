@@ -67,12 +67,40 @@ std::string_view osReleaseValue(std::string_view text, std::string_view name) {
   return value;
 }
 
-OsReleaseBuildVariant::OsReleaseBuildVariant(const std::string& path)
-    : internal_(osReleaseValue(readSmallFile(path, kMaxOsReleaseSize).value_or(""), "VARIANT_ID") ==
-                "internal") {}
+OsReleaseBuildVariant::OsReleaseBuildVariant(std::string path, Clock clock)
+    : path_(std::move(path)), clock_(clock) {
+  readAgain(clock_());
+}
+
+// The coarse clock is read without a system call on every machine. The exact clocks are not: under
+// some hypervisors each reading enters the kernel. It moves in steps of at most 10 ms.
+int64_t OsReleaseBuildVariant::coarseMilliseconds() {
+  timespec time{};
+  clock_gettime(CLOCK_MONOTONIC_COARSE, &time);
+  return int64_t{time.tv_sec} * 1000 + time.tv_nsec / 1'000'000;
+}
 
 bool OsReleaseBuildVariant::hasInternalDiagnostics(std::string_view /*subsystem*/) {
-  return internal_;
+  const int64_t now = clock_();
+  if (now < staleFrom_.load(std::memory_order_acquire)) [[likely]]
+    return internal_.load(std::memory_order_relaxed);
+  return readAgain(now);
+}
+
+// Watching the file with inotify was discarded: it takes a thread or a system call per question,
+// and it misses a file that is replaced under another mount.
+bool OsReleaseBuildVariant::readAgain(int64_t now) {
+  // Less than a second by two steps of the coarse clock.
+  constexpr int64_t kMaxAgeMilliseconds = 980;
+  // Threads that ask meanwhile wait for the new answer, because the old one is already too old.
+  const std::lock_guard lock(reading_);
+  if (now < staleFrom_.load(std::memory_order_relaxed)) return internal_;
+  const std::string text = readSmallFile(path_, kMaxOsReleaseSize).value_or("");
+  const bool internal = osReleaseValue(text, "VARIANT_ID") == "internal";
+  internal_.store(internal, std::memory_order_relaxed);
+  // `now` was read before the file, so the answer is never older than we think.
+  staleFrom_.store(now + kMaxAgeMilliseconds, std::memory_order_release);
+  return internal;
 }
 
 namespace {

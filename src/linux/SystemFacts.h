@@ -2,7 +2,9 @@
 
 #pragma once
 
+#include <atomic>
 #include <cstdint>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -29,19 +31,29 @@ class SystemClock final : public Clock {
 // the last counts, as for a shell that reads the file. Empty if there is none. Points into `text`.
 std::string_view osReleaseValue(std::string_view text, std::string_view name);
 
-// The build variant as the os-release file tells it. The constructor reads the file once.
-// Immutable; any thread may ask.
+// The build variant as the os-release file tells it. The service asks for every object, and a
+// process may stay for months while the file changes. So the answer is at most a second old, and
+// an answer costs a look at the clock. Any thread may ask.
 class OsReleaseBuildVariant final : public BuildVariant {
  public:
   // `path` names a file in the os-release format. The build is internal if VARIANT_ID is
-  // "internal", and not if the file cannot be read or has no such line.
-  explicit OsReleaseBuildVariant(const std::string& path);
+  // "internal", and not if the file cannot be read or has no such line. `clock` counts milliseconds
+  // and never goes back.
+  using Clock = int64_t (*)();
+  explicit OsReleaseBuildVariant(std::string path, Clock clock = coarseMilliseconds);
 
   // The same for every subsystem.
   bool hasInternalDiagnostics(std::string_view subsystem) override;
 
  private:
-  const bool internal_;
+  static int64_t coarseMilliseconds();
+  bool readAgain(int64_t now);
+
+  const std::string path_;
+  const Clock clock_;
+  std::mutex reading_;
+  std::atomic<bool> internal_{false};
+  std::atomic<int64_t> staleFrom_{0};  // the first moment at which the answer is too old
 };
 
 // The kernel's mount table. It is read again when the kernel says that it changed. One thread at a

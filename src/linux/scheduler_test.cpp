@@ -153,7 +153,8 @@ class StateDirectoryTest : public ::testing::Test {
  protected:
   static StateDirectory opened(const std::string& path) {
     auto result = StateDirectory::open(path);
-    if (const auto* error = std::get_if<std::string>(&result)) throw std::runtime_error(*error);
+    if (const auto* error = std::get_if<PlatformError>(&result))
+      throw std::runtime_error(error->words);
     return std::get<StateDirectory>(result);
   }
 
@@ -174,12 +175,36 @@ TEST_F(StateDirectoryTest, IsMadeForOwnerAndGroup) {
 TEST_F(StateDirectoryTest, AnUnusableOneHasItsReason) {
   const auto errorOf = [](const std::string& path) {
     const auto result = StateDirectory::open(path);
-    return std::holds_alternative<std::string>(result) ? std::get<std::string>(result) : "opened";
+    const auto* error = std::get_if<PlatformError>(&result);
+    return error ? error->words : "opened";
   };
   const std::string file = temporary_.write("file", "");
   EXPECT_EQ(errorOf(file), "state directory " + file + ": Not a directory");
   EXPECT_EQ(errorOf(file + "/state"), "state directory " + file + "/state: Not a directory");
   EXPECT_EQ(errorOf("/proc/tessel"), "state directory /proc/tessel: No such file or directory");
+}
+
+TEST_F(StateDirectoryTest, OnlyFilesOfItsOwnerAreBelieved) {
+  const std::string record = temporary_.path("deep/state/scheduler-last-run");
+  const auto isRefusedWith = [&](const std::string& words) {
+    const auto refused = state_.refusedFiles();
+    EXPECT_EQ(state_.lastRun(), std::nullopt);
+    EXPECT_FALSE(state_.recordRun(kNoon)) << "the next write heals it";
+    const bool healed = state_.lastRun() == kNoon && state_.refusedFiles().empty();
+    std::filesystem::remove(record);
+    return healed && refused.size() == 1 && refused[0].words.starts_with(record + ": " + words);
+  };
+  temporary_.write("forged", "1795000000000000\n");
+  std::filesystem::create_symlink(temporary_.path("forged"), record);
+  EXPECT_TRUE(isRefusedWith("it is no regular file"));
+  for (const char* name : {"", ".new"}) ASSERT_EQ(::mkfifo((record + name).c_str(), 0666), 0);
+  EXPECT_TRUE(isRefusedWith("it is no regular file"));
+  ASSERT_EQ(::mknod(record.c_str(), S_IFSOCK | 0666, 0), 0);
+  EXPECT_TRUE(isRefusedWith("it is no regular file"));
+  temporary_.write("deep/state/scheduler-last-run", std::string(65, '1'));
+  EXPECT_TRUE(isRefusedWith("File too large"));
+  std::filesystem::create_directories(record + ".new/full");
+  EXPECT_TRUE(state_.recordRun(kNoon));
 }
 
 TEST_F(StateDirectoryTest, OneHolderOfTheLockAtATime) {

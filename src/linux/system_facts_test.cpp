@@ -83,11 +83,22 @@ TEST(BuildVariantTest, TheLastVariantIdCounts) {
       OsReleaseBuildVariant(directory.path("none")).hasInternalDiagnostics("com.vantor.tessel"));
 }
 
-TEST(BuildVariantTest, TheFileIsReadOnce) {
+TEST(BuildVariantTest, TheAnswerIsAtMostASecondOld) {
+  static int64_t now;
+  now = 5000;
   const TemporaryDirectory directory;
-  OsReleaseBuildVariant variant(directory.write("os-release", "VARIANT_ID=internal\n"));
+  OsReleaseBuildVariant variant(directory.write("os-release", "VARIANT_ID=internal\n"),
+                                [] { return now; });
+  const auto isInternalAt = [&variant](int64_t milliseconds) {
+    now = milliseconds;
+    return variant.hasInternalDiagnostics("com.vantor.tessel");
+  };
   directory.write("os-release", "");
-  EXPECT_TRUE(variant.hasInternalDiagnostics("com.vantor.tessel"));
+  EXPECT_TRUE(isInternalAt(5900)) << "the file is not read for every question";
+  EXPECT_FALSE(isInternalAt(6000));
+  directory.write("os-release", "VARIANT_ID=internal\n");
+  EXPECT_FALSE(isInternalAt(6001));
+  EXPECT_TRUE(isInternalAt(7000));
 }
 
 TEST(IcuDatesTest, FormatsByLocaleAndTimeZone) {

@@ -11,6 +11,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Error.h"
 #include "platform/Queues.h"
 
 namespace tessel {
@@ -43,8 +44,8 @@ struct FileExistence {
 
 struct RemovalResult {
   bool removed = false;
-  // Why not, in words. Absent if the system gave no reason.
-  std::optional<std::string> error;
+  // Why not. Absent if the system gave no reason.
+  std::optional<PlatformError> error;
 };
 
 class FileManager {

@@ -72,7 +72,7 @@ void CookieFile::clearCookieFile() {
     // This is an error, because the next run will find the marker, think that this run died, and
     // read nothing.
     tesselReporterLog().error("Could not clear cookie file: %@",
-                              result.error.value_or("Unknown error"));
+                              result.error ? result.error->words : "Unknown error");
   }
 }
 

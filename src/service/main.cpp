@@ -17,6 +17,7 @@
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
 #include "linux/SystemFacts.h"
+#include "os/Files.h"
 #include "platform/Queues.h"
 #include "service/ReportingRun.h"
 #include "statora/ConfigurationFiles.h"
@@ -46,9 +47,21 @@ LaunchConfiguration launchConfiguration() {
   return std::get<LaunchConfiguration>(std::move(read));
 }
 
+// With too few descriptors every part would fail in a way of its own, and some of them silently: a
+// configuration that cannot be opened looks like one that is not there. The run of a single small
+// file has 8 open at a time; half of the limit is left to the files of the journal.
+void requireDescriptors() {
+  constexpr size_t kNeeded = 32;
+  const size_t allowed = allowDescriptors(kNeeded);
+  if (allowed >= kNeeded) return;
+  refuse(kExitDescriptors, "the limit on open files (RLIMIT_NOFILE) is " + std::to_string(allowed) +
+                               ", and the service needs " + std::to_string(kNeeded));
+}
+
 StateDirectory& stateDirectory(const std::string& path) {
   auto opened = StateDirectory::open(path);
-  if (const auto* error = std::get_if<std::string>(&opened)) refuse(kExitStateDirectory, *error);
+  if (const auto* error = std::get_if<PlatformError>(&opened))
+    refuse(kExitStateDirectory, error->words);
   return keep<StateDirectory>(std::get<StateDirectory>(std::move(opened)));
 }
 
@@ -116,8 +129,11 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
 
 [[noreturn]] void serve() {
   const LaunchConfiguration launch = launchConfiguration();
+  requireDescriptors();
   StateDirectory& state = stateDirectory(launch.stateDirectory);
   setLogSink(makeLogSink(launch.logDestination).release(), launch.logLevel);
+  for (const PlatformError& refused : state.refusedFiles())
+    platformLog().warning("A file in the state directory is not used: %@", refused.words);
 
   auto& clock = keep<SystemClock>();
   ServiceManager& manager = *connectServiceManager(clock).release();

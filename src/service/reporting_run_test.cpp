@@ -155,7 +155,7 @@ TEST_F(RunTest, WithoutAMarkerOfItsOwnARunDoesNothing) {
 }
 
 TEST_F(RunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
-  files.removal = RemovalResult{false, "Permission denied"};
+  files.removal = RemovalResult{false, PlatformError{ErrorCode::noAccess, "Permission denied"}};
   perform();
   files.items.clear();
   files.removal = RemovalResult{false, {}};
@@ -165,7 +165,7 @@ TEST_F(RunTest, AMarkerThatStaysIsAnErrorWithTheReason) {
 }
 
 TEST_F(RunTest, AMarkerIsClearedAndMadeOnlyIfNeeded) {
-  files.removal = RemovalResult{false, "No such file or directory"};
+  files.removal = RemovalResult{false, PlatformError{ErrorCode::notFound, "gone"}};
   cookie.clearCookieFile();
   files.items[cookieFilePath] = false;
   EXPECT_FALSE(cookie.createCookieFile());
