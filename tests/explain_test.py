@@ -163,6 +163,20 @@ class MixedDay(ExplainTest):
         self.assertEqual(changes["com.vantor.Fresh"], ("start", 1, "not_recorded"))
         self.assertNotIn("com.vantor.Both", changes)
 
+    def test_compare_counts_what_it_has_no_room_for(self):
+        names = [*range(65_530), *range(65_520, 65_530), *range(65_530, 65_560)]
+        self.machine.write_export(point("event", "com.vantor.Many", "A", f"N{name}", at=-90000 + i / 1000)
+                                  for i, name in enumerate(names))
+        arguments = ("compare", "since=-26h,until=-24h", "since=-1m")
+        compared = json.loads(self.assert_clean(self.machine.ctl(*arguments, "--json")).out)
+        self.assertEqual((compared["a"]["reported"], compared["objects_not_compared"]), (len(names), 24))
+        self.assertEqual(compared["stops"], len(names) - 24)
+        self.assertEqual(sum(change["count"] for change in compared["changes"]) + compared["changes_not_listed"],
+                         compared["stops"])
+        text = self.assert_clean(self.machine.ctl(*arguments)).out
+        self.assertIn(f'{compared["changes_not_listed"]:,} objects had further changes', text.replace("\u202f", ","))
+        self.assertIn("24 objects of further trace points not compared", text)
+
 
 class Periods(ExplainTest):
     def test_a_period_is_what_the_arguments_say(self):
@@ -299,6 +313,12 @@ class Report(ExplainTest):
             self.assertEqual(sum(row[0] for row in page.tables["misses"][1:]), summary["verdicts"]["string_whitelist"])
             self.assertEqual({row[0]: {"reported": row[1], "unreported": row[2]} for row in page.tables["kinds"][1:]},
                              summary["kinds"])
+
+    def test_the_busiest_time_may_have_a_single_object(self):
+        self.machine.write_export([point("event", "com.vantor.Calendar", "View", "Open")])
+        page = self.page()
+        [busiest] = PageReader(page).tables["slices"][1:]
+        self.assertIn(f"most, 1, from {busiest[0]}.", page)
 
     def test_no_recorded_string_becomes_markup(self):
         texts = self.MARKUP + ["\x1b[31mred", "\u202eright", "line\nfeed", "\x00", "caf\udce9"]

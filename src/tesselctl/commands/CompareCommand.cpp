@@ -125,15 +125,26 @@ std::string textOf(StringRef text) { return std::string(text.textOr("")); }
 struct Comparison {
   VerdictCounts sides[2] = {};
   Changes changes;
+  uint64_t notCompared = 0;  // objects of trace points beyond kMaxPaths
   std::optional<PlatformError> error;
-  StoreReport store;  // of the last reading
-  Losses losses;      // of each reading
+  StoreReport unread;  // the files that any reading was refused, and the most that one left out
+  Losses losses;       // of each reading
 };
 
-// Two periods may read different files, so the losses of both readings are added up.
+// Two periods may read different files, so the losses of both readings are added up. A file that
+// neither could read is one file all the same.
 void takeReading(const DryRun& run, Comparison& comparison) {
-  comparison.store = run.report().store;
-  comparison.losses.add(comparison.store.reading.losses);
+  const StoreReport& read = run.report().store;
+  comparison.losses.add(read.reading.losses);
+  const auto leftOut = [](const StoreReport& report) {
+    return report.reading.losses.sum(LossCode::filesNotLookedAt);
+  };
+  if (leftOut(read) >= leftOut(comparison.unread)) comparison.unread.reading = read.reading;
+  std::vector<FileReport>& refused = comparison.unread.files;
+  for (const FileReport& file : read.files) {
+    const auto same = [&](const FileReport& other) { return other.path == file.path; };
+    if (file.refused && std::ranges::none_of(refused, same)) refused.push_back(file);
+  }
 }
 
 // One period, two judges.
@@ -164,7 +175,7 @@ struct PathFigures {
 using Path = std::tuple<std::string, std::string, std::string>;
 
 // A program that puts numbers into its names makes new paths without end. Objects of paths beyond
-// this bound count in the sums of their side, but no change is found for them.
+// this bound count in the sums of their side, but no change is found for them. They are counted.
 constexpr size_t kMaxPaths = 65536;
 
 // The verdict that held back most objects.
@@ -196,6 +207,8 @@ void comparePeriods(const Setting (&settings)[2], const Reading& reading, Compar
         ++known->second.sides[side][verdict];
       } else if (paths.size() < kMaxPaths) {
         ++paths[std::move(path)].sides[side][verdict];
+      } else {
+        ++comparison.notCompared;
       }
       return true;
     });
@@ -235,6 +248,7 @@ std::string comparisonJson(const Comparison& comparison) {
     json.array("changes", comparison.changes.listed(),
                [&](const auto& counted) { writeChange(json, counted.first, counted.second); });
     json.member("changes_not_listed", comparison.changes.notListed());
+    json.member("objects_not_compared", comparison.notCompared);
     addLosses(json, comparison.losses);
   });
 }
@@ -269,6 +283,10 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
                             terminal.width, 2) +
                     "\n";
   if (!table.empty()) out += "\n" + table.render(terminal, 2);
+  if (const uint64_t count = comparison.changes.notListed(); count != 0)
+    out += "  " + counted(count, "object", "objects") + " had further changes\n";
+  if (const uint64_t count = comparison.notCompared; count != 0)
+    out += "  " + counted(count, "object", "objects") + " of further trace points not compared\n";
   if (!comparison.losses.empty()) out += "\n" + lossText(comparison.losses, terminal);
   return out;
 }
@@ -287,7 +305,7 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   print(options.json ? comparisonJson(comparison)
                      : comparisonText(comparison, options, surroundings.terminal));
   std::fflush(stdout);
-  return warnOfUnreadFiles(comparison.store, reading->store);
+  return warnOfUnreadFiles(comparison.unread, reading->store);
 }
 
 const CommandText kCompare{

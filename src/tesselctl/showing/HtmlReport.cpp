@@ -142,7 +142,7 @@ Html verdictSection(const Tally& tally) {
 
 // The least round number that is not below `highest`. The steps are so close that the highest
 // column fills at least half of the chart.
-uint64_t roundTop(uint64_t highest) {
+uint64_t roundTop(uint64_t highest) {  // at least 1, because heights are shares of it
   for (uint64_t unit = 1;; unit *= 10) {
     for (const uint64_t step : {1U, 2U, 3U, 4U, 5U, 6U, 8U}) {
       if (unit * step >= highest) return unit * step;
@@ -199,14 +199,13 @@ Html sliceTable(const Tally& tally) {
 }
 
 Html timeSection(const Tally& tally) {
-  uint64_t highest = 1;
+  uint64_t highest = 0;
   size_t busiest = 0;
   for (size_t slice = 0; slice < tally.slices().size(); ++slice) {
     if (sumOf(tally.slices()[slice]) <= highest) continue;
     highest = sumOf(tally.slices()[slice]);
     busiest = slice;
   }
-  // At least 1, since the heights are shares of it.
   const uint64_t top = roundTop(highest);
   Html html;
   html << "<section>\n<h2>Over time</h2>\n<p class=\"soft\">Trace objects; a column is "
