@@ -88,14 +88,14 @@ class ForwarderTest(unittest.TestCase):
 
 class Delivery(ForwarderTest):
     def test_a_record_keeps_kinds_and_order_of_the_event(self):
-        self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,'
+        self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,"G":5.0,'
                          '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open")
         with Receiver() as receiver:
             self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
         request = receiver.requests[0]
         self.assertEqual(request.path, "/v1/logs")
         self.assertEqual(request.headers["Content-Type"], "application/json")
-        self.assertIn('{"key":"F","value":{"doubleValue":0.1}}', request.text)
+        self.assertIn('{"key":"F","value":{"doubleValue":0.1}},{"key":"G","value":{"doubleValue":5.0}}', request.text)
         self.assertEqual(request.records, [{
             "timeUnixNano": "1795000000000000000", "observedTimeUnixNano": "1795000000000000000",
             "eventName": "ts__com.vantor.Calendar__View__Open",
@@ -105,6 +105,7 @@ class Delivery(ForwarderTest):
                            {"key": "A", "value": {"intValue": "-9223372036854775808"}},
                            {"key": "B", "value": {"stringValue": "18446744073709551615"}},
                            {"key": "F", "value": {"doubleValue": 0.1}},
+                           {"key": "G", "value": {"doubleValue": 5.0}},
                            {"key": "DurationInSeconds", "value": {"doubleValue": 2}},
                            {"key": "N", "value": {}}]}])
         resource = json.loads(request.text)["resourceLogs"][0]["resource"]["attributes"]

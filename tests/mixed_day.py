@@ -36,6 +36,8 @@ def mixed_day(machine):
         point("event", "com.vantor.Mail", "Fetch", "Sizes", number1=("bytes", "18446744073709551615"),
               number2=("delta", "-9223372036854775808"), exe=mail),
         point("event", "com.vantor.Mail", "Fetch", "Ratios", number1=("ratio", "0.1"), number2=(None, "5"), exe=mail),
+        point("event", "com.vantor.Mail", "Fetch", "Kinds", number1=("whole", "5.0"), number2=("tiny", "-1e-400"),
+              duration="3.4028235e38", exe=mail),
         point("event", "com.vantor.Mail", "Fetch", "Label alone", number1=("count", None), exe=mail),
         point("event", "com.vantor.Mail", "Gr\u00fc\u00dfe \"quoted\" \\ \U0001f600", "Name/with__marks", **bare),
         point("event", "com.vantor.quellan.knowledge", "tessel", "Footprint"),

@@ -1,8 +1,10 @@
 #!/usr/bin/env python3
 """Whole runs over a real journal: compares every row of the spool and every line of the log."""
+import datetime
 import os
 import re
 import subprocess
+import time
 
 import harness
 from harness import MachineTest
@@ -34,7 +36,8 @@ class MixedDay(MachineTest):
     def assert_rows(self, expected):
         rows = self.machine.rows()
         name, statistics = rows[-1]
-        self.assertEqual(rows[:-1], expected.object_rows + expected.count_rows())
+        # As text, because Python takes 5 and 5.0 for equal.
+        self.assertEqual([*map(repr, rows[:-1])], [*map(repr, expected.object_rows + expected.count_rows())])
         self.assertEqual(name, "com.vantor.performance.tessel_reporting_stats")
         self.assertEqual(statistics[0][0], "ProcessingDurationInSeconds")
         self.assertEqual(statistics[1:], expected.statistics())
@@ -96,6 +99,13 @@ class MixedDay(MachineTest):
         result = self.run_clean(TESSEL_LOG_LEVEL="error")
         self.assertEqual(result.log, [])
         self.assert_rows(self.expected())
+
+    def test_the_zone_of_the_dates_may_be_a_rule(self):
+        lines = self.run_clean(TZ="XYZ-5:30").log
+        [date] = [found.group(1) for line in lines if (found := re.search(r" between (.*?) and ", line))]
+        at = datetime.datetime.strptime(date.replace("\u202f", " "), "%m/%d/%y, %I:%M:%S %p")
+        there = datetime.datetime.utcfromtimestamp(time.time()) + datetime.timedelta(hours=5.5 - 24)
+        self.assertLess(abs(there - at), datetime.timedelta(minutes=2))
 
     def test_without_a_journal_lines_go_to_stderr(self):
         without_journal = "[ ! -d /run/systemd/journal ] || mount -n -t tmpfs none /run/systemd/journal; exec $0"

@@ -27,8 +27,9 @@ namespace {
 
 using Json = nlohmann::json;
 
-// These members are floating-point numbers, but the spool writes 2.0 as 2, which looks like an
-// integer. A backend that receives both kinds under one name may refuse one of them.
+// These members are floating-point numbers. The spool writes 2.0 for 2, but rows of an older
+// version may wait in it that have 2, which looks like an integer. A backend that receives both
+// kinds under one name may refuse one of them.
 constexpr std::string_view kFloatingKeys[] = {"DurationInSeconds", "FrameRate",
                                               "ProcessingDurationInSeconds"};
 

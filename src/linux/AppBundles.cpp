@@ -173,7 +173,7 @@ struct OneFile {
   bool unclear = false;  // there are several files, or we could not look at all entries
 };
 
-struct CloseDirectory {
+struct CloseStream {
   void operator()(DIR* directory) const { ::closedir(directory); }
 };
 
@@ -183,7 +183,7 @@ OneFile oneFile(Walk& walk, const Place& bundle, const std::string& path, const 
                 const std::vector<std::string_view>& suffixes) {
   OneFile one;
   const int fd = ::openat(place.fd.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  const std::unique_ptr<DIR, CloseDirectory> directory(fd < 0 ? nullptr : ::fdopendir(fd));
+  const std::unique_ptr<DIR, CloseStream> directory(fd < 0 ? nullptr : ::fdopendir(fd));
   if (!directory) return one;
   size_t seen = 0;
   while (const dirent* entry = ::readdir(directory.get())) {

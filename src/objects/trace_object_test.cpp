@@ -49,7 +49,7 @@ TEST_F(PayloadTest, AbsentValuesAreLeftOutOrUnknown) {
   point.numbers = {{{{}, int64_t{1}}, {"share", {}}}};
   EXPECT_EQ(json(*makeEvent(point)),
             R"({"Name":"Unknown","String2Name":"size","Number2Name":"share",)"
-            R"("IntervalType":"Event","DurationInSeconds":0,"StartProcessName":"Unknown"})");
+            R"("IntervalType":"Event","DurationInSeconds":0.0,"StartProcessName":"Unknown"})");
   // And the other way round.
   point = {};
   point.strings = {{{"period", {}}, {{}, "small"}}};
@@ -57,7 +57,7 @@ TEST_F(PayloadTest, AbsentValuesAreLeftOutOrUnknown) {
   EXPECT_EQ(json(*makeObject(point)),
             R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
             R"("String1Name":"period","Number1Name":"count",)"
-            R"("IntervalType":"TesselObject","DurationInSeconds":0})");
+            R"("IntervalType":"TesselObject","DurationInSeconds":0.0})");
   EXPECT_EQ(json(TesselSupportObject()), "none");
 }
 
@@ -70,7 +70,7 @@ TEST_F(PayloadTest, BeginAndEndHaveNamesOfTheirOwn) {
   point.endProcessName = "clockd";
   EXPECT_EQ(json(*makeInterval(point)),
             R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open",)"
-            R"("IntervalType":"Interval","DurationInSeconds":0,)"
+            R"("IntervalType":"Interval","DurationInSeconds":0.0,)"
             R"("StartProcessName":"com.vantor.Clock","EndProcessName":"clockd"})");
   point.subsystem = "com.vantor.morvald";  // which may be overridden, and is not
   point.endProcessName = {};
@@ -78,7 +78,7 @@ TEST_F(PayloadTest, BeginAndEndHaveNamesOfTheirOwn) {
   EXPECT_EQ(
       json(*makeAnimationInterval(point)),
       R"({"Subsystem":"com.vantor.morvald","Category":"View","Name":"Open",)"
-      R"("IntervalType":"AnimationInterval","DurationInSeconds":0,)"
+      R"("IntervalType":"AnimationInterval","DurationInSeconds":0.0,)"
       R"("StartProcessName":"com.vantor.Clock","EndProcessName":"Unknown","FrameRate":59.94})");
 }
 

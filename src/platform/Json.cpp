@@ -41,9 +41,8 @@ bool isEscaped(char32_t point, bool forTerminal) {
 }
 
 template <typename Value>
-void appendDigits(std::string& out, Value value) {
-  char buffer[32];  // the longest is a double: a sign, 17 digits, a point and "e-308"
-  out.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, value).ptr);
+std::string_view digits(char (&buffer)[32], Value value) {  // of a double up to 24
+  return {buffer, std::to_chars(buffer, std::end(buffer), value).ptr};
 }
 
 }  // namespace
@@ -134,33 +133,39 @@ void JsonWriter::string(std::string_view text) {
 }
 
 void JsonWriter::number(int64_t value) {
+  char buffer[32];
   separate();
-  appendDigits(out_, value);
+  out_ += digits(buffer, value);
 }
 
 void JsonWriter::number(uint64_t value) {
+  char buffer[32];
   separate();
-  appendDigits(out_, value);
+  out_ += digits(buffer, value);
 }
 
 // A float is not widened: the shortest digits of 0.1f are "0.1", those of the same number as a
 // double are "0.10000000149011612", which nobody recorded.
 void JsonWriter::number(float value) {
-  if (!std::isfinite(value)) {
-    raw("null");
-    return;
-  }
-  separate();
-  appendDigits(out_, value);
+  char buffer[32];
+  fraction(std::isfinite(value), digits(buffer, value));
 }
 
 void JsonWriter::number(double value) {
-  if (!std::isfinite(value)) {
+  char buffer[32];
+  fraction(std::isfinite(value), digits(buffer, value));
+}
+
+// The shortest digits of 5.0 are "5". A reader would take them for an integer, and a backend that
+// has met both kinds under one name may refuse one of them.
+void JsonWriter::fraction(bool finite, std::string_view shortest) {
+  if (!finite) {
     raw("null");
     return;
   }
   separate();
-  appendDigits(out_, value);
+  out_ += shortest;
+  if (shortest.find_first_of(".e") == std::string_view::npos) out_ += ".0";
 }
 
 }  // namespace tessel

@@ -38,7 +38,8 @@ class JsonWriter {
 
   // A text, a number, a bool, a date (microseconds since 1970), or an optional or a variant that
   // holds one of these. Numbers get the shortest digits that read back as the same number of their
-  // own type. JSON has no infinity and no NaN, so a number that is not finite is written as null.
+  // own type. They show their kind: a float or double has a point or an exponent, an integer has
+  // neither. JSON has no infinity and no NaN, so a number that is not finite is written as null.
   template <typename T>
   JsonWriter& value(const T& value);
   // `json` is one valid JSON value in UTF-8.
@@ -78,6 +79,7 @@ class JsonWriter {
   void number(uint64_t value);
   void number(float value);
   void number(double value);
+  void fraction(bool finite, std::string_view shortest);
 
   std::string& out_;
   const JsonStyle style_;

@@ -160,8 +160,9 @@ using Number = std::variant<bool, int64_t, uint64_t, float, double>;
 
 // False for false, 0 and 0.0; true for every other number.
 bool booleanValue(const Number& number);
-// The number as JSON text: the shortest digits that read back as the same number of its kind,
-// "true" or "false" for a boolean, "null" for a number that is not finite.
+// The number as JSON text: the shortest digits that read back as the same number of its kind ("5"
+// for an integer, "5.0" for a float or double), "true" or "false" for a boolean, "null" for a
+// number that is not finite.
 std::string numberText(const Number& number);
 
 // A flat dictionary: keys to strings or numbers, in the order in which the keys were first set.

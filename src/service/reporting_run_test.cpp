@@ -118,7 +118,7 @@ TEST_F(RunTest, AnObjectIsTwoEventsAndANamelessOneOne) {
   EXPECT_EQ(
       sender.events[0].json,
       R"({"Subsystem":"com.vantor.Calendar","Category":"View","Name":"Open","IntervalType":"Event",)"
-      R"("DurationInSeconds":0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
+      R"("DurationInSeconds":0.0,"StartProcessName":"Unknown","BootPartitionFS":"ext4","BootDiskType":"SSD"})");
 }
 
 TEST_F(RunTest, WithoutTaskingNothingIsTouched) {

@@ -181,11 +181,12 @@ static_assert(std::ranges::is_partitioned(kJournalFields,
                                           [](const auto& field) { return !!field.whenMissing; }));
 constexpr bool isRequired(FieldKind kind) { return static_cast<size_t>(kind) < kRequiredFields; }
 
-// An integer becomes an int64_t, or a uint64_t if it is too large for that. Any other finite
-// decimal becomes a double. Absent for all other texts, such as one with a space or a plus sign.
+// An integer becomes an int64_t, or a uint64_t if it is too large for that. Any other decimal
+// becomes the nearest double, which is 0 for "1e-400". Absent if it is beyond all doubles, and for
+// all other texts, such as one with a space or a plus sign.
 std::optional<Number> parseDecimal(std::string_view text);
 
-// Absent if `text` is no finite decimal or is outside the range of a 32-bit float.
+// The nearest 32-bit float. Absent if `text` is no decimal or is beyond all floats.
 std::optional<float> parseFloat(std::string_view text);
 
 }  // namespace tessel

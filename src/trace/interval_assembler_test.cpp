@@ -198,14 +198,16 @@ TEST_F(IntervalAssemblerTest, theEndWinsAndTheBeginFillsIn) {
       {"telemetry is 1 and nothing else",
        {"begin|TELEMETRY=yes", "end|TELEMETRY=true"},
        {interval}},
-      {"a stated duration of the begin", {"begin|DURATION=2", "end"}, {interval + " 2s"}},
-      {"a stated duration of the end", {"begin|DURATION=2", "end|DURATION=3"}, {interval + " 3s"}},
+      {"a stated duration of the begin", {"begin|DURATION=2", "end"}, {interval + " 2.0s"}},
+      {"a stated duration of the end",
+       {"begin|DURATION=2", "end|DURATION=3"},
+       {interval + " 3.0s"}},
       {"each end its process",
        {"begin|_EXE=/a|_COMM=a", "end|_COMM=b"},
        {interval + " begin=/a beginName=a endName=b"}},
       {"a frame rate on the begin",
        {"begin|FRAME_RATE=60", "end"},
-       {"Animation" + interval + " 60fps"}},
+       {"Animation" + interval + " 60.0fps"}},
       {"a frame rate on the end",
        {"begin|FRAME_RATE=60", "end|FRAME_RATE=59.5"},
        {"Animation" + interval + " 59.5fps"}},
@@ -223,7 +225,7 @@ TEST_F(IntervalAssemblerTest, durationIsEndLessBegin) {
   EXPECT_THAT(runEntries({tracePoint("begin", 5'000'000), tracePoint("end", 5'000'001)}),
               ElementsAre("Interval com.vantor.Calendar/View 1e-06s"));
   EXPECT_THAT(runEntries({tracePoint("begin", 5'000'000), tracePoint("end", 4'000'000)}),
-              ElementsAre("Interval com.vantor.Calendar/View -1s"));
+              ElementsAre("Interval com.vantor.Calendar/View -1.0s"));
 }
 
 TEST_F(IntervalAssemblerTest, malformedIsCountedByReason) {
@@ -308,7 +310,7 @@ TEST_F(IntervalAssemblerTest, intervalsOutliveAGeneration) {
   EXPECT_THAT(
       run({"end|INTERVAL_ID=x|NAME=Open|_PID=3", "end|INTERVAL_ID=y|INTERVAL_SCOPE=system|_PID=4"}),
       ElementsAre("AnimationInterval com.vantor.Calendar/View name=Open s1v=week "
-                  "n1v=18446744073709551615 n2v=0.25 telemetry begin=/a override=b 60fps",
+                  "n1v=18446744073709551615 n2v=0.25 telemetry begin=/a override=b 60.0fps",
                   "Interval com.vantor.Calendar/View"));
   EXPECT_EQ(assembler().counts().droppedOpenIntervals, 0u);
 }
