@@ -206,6 +206,29 @@ class Trouble(ForwarderTest):
         self.assertEqual(self.errors, "statora_forwarder: error: The collector rejected 2 records: too old\n")
         self.assert_all_arrived_once(receiver, 5)
 
+    def test_what_was_rejected_counts_once(self):
+        self.add(1)
+        with Receiver() as receiver:
+            self.run_forwarder(receiver)  # makes the forwarder's tables, so its next write is an acknowledgement
+        self.add(5)
+        body = b'{"partialSuccess":{"rejectedLogRecords":"2","errorMessage":"too old"}}'
+        with Receiver(lambda request, number: Answer(200, body)) as receiver:
+            failed = self.run_forwarder(receiver, **FaultMachine.faults(CALL="pwrite64", PATH="-wal", AT=1, TIMES=1, ERRNO=5))
+            self.assertEqual((failed.returncode, self.run_forwarder(receiver).returncode), (66, 0), self.errors)
+        self.assertEqual(len(receiver.requests), 2)
+        self.assertEqual((self.counters()["delivered"], self.counters()["rejected"]), (6, 2))
+
+    def test_a_newer_spool_is_used_if_it_says_so(self):
+        self.add(1)
+        self.query("PRAGMA user_version=2")
+        with Receiver() as receiver:
+            for oldest, status in ((None, 66), ("2", 66), ("1", 0)):
+                if oldest:
+                    self.query(f"INSERT OR REPLACE INTO meta VALUES('compatible_from', '{oldest}')")
+                self.assertEqual(self.run_forwarder(receiver).returncode, status, self.errors)
+                self.assertEqual("made by another version (schema 2)" in self.errors, status == 66, self.errors)
+        self.assert_all_arrived_once(receiver, 1)
+
     def test_a_bad_record_is_set_aside_with_the_answer(self):
         self.add(1000)
 
@@ -275,7 +298,8 @@ class PowerCut(ForwarderTest):
 
         def look(request, _):
             """What the spool would hold if the power failed now."""
-            shutil.copy(os.path.join(durable, "statora.db-wal"), cut)
+            for name in os.listdir(durable):
+                shutil.copy(os.path.join(durable, name), cut)
             with sqlite3.connect(os.path.join(cut, "statora.db")) as database:
                 survived.append(database.execute("SELECT max(id), (SELECT seq FROM sqlite_sequence) FROM events")
                                 .fetchone())

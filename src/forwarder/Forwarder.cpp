@@ -208,13 +208,12 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
   // After a partial success nothing is sent again: the collector would take the good records twice.
   const PartialSuccess partial = world_.encoder.partialSuccess(answer.body);
   if (partial.rejected > 0) {
-    world_.state.counters().rejected += partial.rejected;
     kForwarderLog.error("The collector rejected %llu records: %@", partial.rejected,
                         partial.message);
   }
   std::vector<int64_t> ids;
   for (const OutgoingRecord& record : part) ids.push_back(record.event.id);
-  const SqliteStatus status = world_.state.acknowledge(ids, world_.clock.now());
+  const SqliteStatus status = world_.state.acknowledge(ids, partial.rejected, world_.clock.now());
   return status.ok() ? Sent::accepted : fail(ForwarderOutcome::spoolFailed, status.reason);
 }
 

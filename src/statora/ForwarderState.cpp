@@ -37,6 +37,15 @@ constexpr int kForwardersPatience = 5000;  // milliseconds
 // lock. A full batch of 512 rows would hold it four times as long.
 constexpr size_t kRowsRemovedAtOnce = 128;
 
+// A newer service may only have added to the spool. It then says in `compatible_from` the oldest
+// version that still finds its way. Without that word a newer spool may mean anything, and sending
+// rows that we do not understand cannot be taken back.
+bool isUnderstood(SqliteDatabase& database, int64_t version) {
+  if (version <= kSpoolSchemaVersion) return version == kSpoolSchemaVersion;
+  const auto oldest = database.integer("SELECT value FROM meta WHERE key='compatible_from'");
+  return oldest && *oldest >= 1 && *oldest <= kSpoolSchemaVersion;
+}
+
 constexpr char kTables[] =
     "BEGIN IMMEDIATE;"
     "CREATE TABLE IF NOT EXISTS forwarder(name TEXT PRIMARY KEY, value INTEGER NOT NULL) WITHOUT "
@@ -78,17 +87,38 @@ std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database)
   return counters;
 }
 
+std::vector<SpooledEvent> readEvents(SqliteStatement& select, int64_t after, size_t maxRows,
+                                     size_t maxBytes) {
+  std::vector<SpooledEvent> events;
+  size_t bytes = 0;
+  select.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
+  while (bytes < maxBytes && select.step() == SqliteStatement::Step::row) {
+    events.push_back({select.integer(0), select.integer(1), std::string(select.text(2)),
+                      std::string(select.text(3))});
+    bytes += events.back().name.size() + events.back().payload.size();
+  }
+  select.reset();
+  return events;
+}
+
 ForwarderState::ForwarderState(std::string stateDirectory, uint64_t maxSetAside)
     : path_(std::move(stateDirectory) + "/" + kSpoolFileName), maxSetAside_(maxSetAside) {}
 
 bool ForwarderState::exists() const {
   struct stat facts {};
-  return ::stat(path_.c_str(), &facts) == 0;
+  return ::lstat(path_.c_str(), &facts) == 0;
 }
 
 SqliteStatus ForwarderState::open() {
   // The service renames a damaged spool and begins a new one under the old name.
   if (database_.isOpen() && isStillThere()) return {};
+  SqliteStatus status = openAndPrepare();
+  // abandon() and not close(): a checkpoint would write into a spool that we cannot use.
+  if (!status.ok()) database_.abandon();
+  return status;
+}
+
+SqliteStatus ForwarderState::openAndPrepare() {
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
   // Acknowledgements make the log grow. The service empties it at 1000 pages, in the middle of a
   // send. The forwarder does so at half that length, to spare the service the work.
@@ -100,21 +130,19 @@ SqliteStatus ForwarderState::open() {
   }
   if (status.ok()) status = prepareStatements();
   if (status.ok()) counters_ = readForwarderCounters(database_).value_or(ForwarderCounters{});
-  if (!status.ok()) database_.close();
   return status;
 }
 
 SqliteStatus ForwarderState::openReadOnly() {
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readOnly);
   if (!status.ok()) return status;
-  select_ = database_.prepare(
-      "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2", true);
+  select_ = database_.prepare(kSelectEvents, true);
   return select_.prepared() ? SqliteStatus{} : database_.status();
 }
 
 bool ForwarderState::isStillThere() const {
   struct stat facts {};
-  return ::stat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
+  return ::lstat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
 }
 
 SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
@@ -122,7 +150,7 @@ SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   // close() would empty and delete the log by its name, and that may by now be the new spool's log.
   database_.abandon();
   struct stat facts {};
-  if (::stat(path_.c_str(), &facts) == 0) {
+  if (::lstat(path_.c_str(), &facts) == 0) {
     device_ = facts.st_dev;
     inode_ = facts.st_ino;
   }
@@ -131,7 +159,7 @@ SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   database_.setBusyTimeout(kForwardersPatience);
   const auto version = database_.integer("PRAGMA user_version");
   if (!version) return database_.status();
-  if (*version != kSpoolSchemaVersion) {
+  if (!isUnderstood(database_, *version)) {
     return {SQLITE_SCHEMA,
             "the spool was made by another version (schema " + std::to_string(*version) + ")"};
   }
@@ -147,9 +175,7 @@ SqliteStatus ForwarderState::prepareStatements() {
     return statement.prepared();
   };
   const bool good =
-      prepare(select_,
-              "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2") &&
-      prepare(remove_, "DELETE FROM events WHERE id=?1") &&
+      prepare(select_, kSelectEvents) && prepare(remove_, "DELETE FROM events WHERE id=?1") &&
       prepare(keep_,
               "INSERT OR REPLACE INTO forwarder_set_aside VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7)") &&
       prepare(
@@ -160,18 +186,8 @@ SqliteStatus ForwarderState::prepareStatements() {
   return good ? SqliteStatus{} : database_.status();
 }
 
-// The reset at the end gives the read lock back. No checkpoint can empty the log while we hold it.
 std::vector<SpooledEvent> ForwarderState::oldest(size_t maxRows, size_t maxBytes, int64_t after) {
-  std::vector<SpooledEvent> events;
-  size_t bytes = 0;
-  select_.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
-  while (bytes < maxBytes && select_.step() == SqliteStatement::Step::row) {
-    events.push_back({select_.integer(0), select_.integer(1), std::string(select_.text(2)),
-                      std::string(select_.text(3))});
-    bytes += events.back().name.size() + events.back().payload.size();
-  }
-  select_.reset();
-  return events;
+  return readEvents(select_, after, maxRows, maxBytes);
 }
 
 uint64_t ForwarderState::waiting() {
@@ -197,24 +213,30 @@ SqliteStatus ForwarderState::finish(bool good) {
   return status;
 }
 
-SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, Date now) {
+SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, uint64_t rejected,
+                                         Date now) {
   const uint64_t deliveredBefore = counters_.delivered;
   const size_t acknowledged = ids.size();
   counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
   while (!ids.empty()) {
     const auto step = ids.first(std::min(ids.size(), kRowsRemovedAtOnce));
-    if (SqliteStatus status = remove(step); !status.ok()) return status;
+    // The rows of a step that fails are sent again, and the collector rejects its part of them
+    // again. So a step counts no more of the rejected rows than it has.
+    const uint64_t rejectedHere = std::min<uint64_t>(rejected, step.size());
+    if (SqliteStatus status = remove(step, rejectedHere); !status.ok()) return status;
     ids = ids.subspan(step.size());
+    rejected -= rejectedHere;
   }
   // Each row was counted in one transaction, and in one only.
   TESSEL_INVARIANT(counters_.delivered == deliveredBefore + acknowledged);
   return {};
 }
 
-SqliteStatus ForwarderState::remove(std::span<const int64_t> ids) {
+SqliteStatus ForwarderState::remove(std::span<const int64_t> ids, uint64_t rejected) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
   counters_.delivered += ids.size();
+  counters_.rejected += rejected;
   // Requeued rows have ids below the position. The maximum keeps it from going back.
   counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
   SqliteStatus status =

@@ -29,6 +29,16 @@ struct SpooledEvent {
   std::string payload;  // a JSON object, unless somebody tampered with the spool
 };
 
+// The oldest rows with an id above `after`: up to `maxRows` rows, or until they hold `maxBytes`,
+// but one row at least. `select` is a prepared kSelectEvents. It is closed again before this
+// returns, because no checkpoint can empty the log while a statement stands open. So whoever prints
+// or sends rows does that between two calls. After an error the rows before it are answered, and
+// the status of the database has the reason.
+std::vector<SpooledEvent> readEvents(SqliteStatement& select, int64_t after, size_t maxRows,
+                                     size_t maxBytes);
+inline constexpr char kSelectEvents[] =
+    "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2";
+
 // What the forwarder has done with this spool since the spool was made.
 struct ForwarderCounters {
   uint64_t delivered = 0;        // records that a collector took, including rejected ones
@@ -63,8 +73,7 @@ class ForwarderState {
   // The following REQUIRE an open spool.
   const std::string& spoolId() const { return spoolId_; }
 
-  // The oldest rows with an id above `after`, up to `maxRows` rows or until they hold `maxBytes`.
-  // Empty if that fails; status() then says why.
+  // See readEvents(). After an error status() says why.
   std::vector<SpooledEvent> oldest(size_t maxRows, size_t maxBytes, int64_t after = 0);
   SqliteStatus status() const { return database_.status(); }
   // Makes the rows that oldest() has answered survive a power cut. REQUIRES: oldest() was called.
@@ -74,9 +83,10 @@ class ForwarderState {
 
   // The counters. The next acknowledgement or setting aside stores them.
   ForwarderCounters& counters() { return counters_; }
-  // Counts the rows as delivered and removes them, in transactions of a few rows each. If it fails,
-  // the rows of the finished transactions are gone and counted, and the others wait. `ids` ascend.
-  SqliteStatus acknowledge(std::span<const int64_t> ids, Date now);
+  // Counts the rows as delivered and removes them, in transactions of a few rows each. `rejected`
+  // of them were thrown away by the collector, which does not say which. If it fails, the rows of
+  // the finished transactions are gone and counted, and the others wait. `ids` ascend.
+  SqliteStatus acknowledge(std::span<const int64_t> ids, uint64_t rejected, Date now);
   // Moves a row to the table of refused rows, with the collector's answer. If the table then has
   // more rows than the limit, its oldest row is deleted.
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
@@ -91,9 +101,10 @@ class ForwarderState {
 
  private:
   SqliteStatus openFresh(SqliteDatabase::Mode mode);
+  SqliteStatus openAndPrepare();
   SqliteStatus prepareStatements();
   bool isStillThere() const;
-  SqliteStatus remove(std::span<const int64_t> ids);
+  SqliteStatus remove(std::span<const int64_t> ids, uint64_t rejected);
   bool writeCounters();
   SqliteStatus finish(bool good);
 

@@ -2,7 +2,9 @@
 // (ForwarderState.h) empties it.
 //
 //   events  one row per event, in the order of sending
-//   meta    facts about this spool; `spool_id` is 32 hexadecimal digits, drawn when it was made
+//   meta    facts about this spool; `spool_id` is 32 hexadecimal digits, drawn when it was made.
+//           `compatible_from`, if it is there, is the oldest schema version whose forwarder may
+//           still deliver the rows. An upgrade that only adds writes it.
 //
 // The forwarder keeps tables of its own in the same file.
 

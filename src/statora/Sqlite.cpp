@@ -3,13 +3,25 @@
 // A thin layer: it owns handles and statements and turns result codes into SqliteStatus. It knows
 // no SQL of the spool. Those statements are few, and their order matters, so they stand in their
 // users.
+//
+// The file comes from a directory in which other programs may write, so open() trusts neither its
+// names nor its content. It looks at the names before SQLite opens them, because opening a pipe for
+// reading waits for a writer, and because a device may act on being opened. What remains: whoever
+// may write to the directory can swap a file between our look and the opening. That can still make
+// a reader wait on a pipe. It cannot lead us to another file, because SQLite follows no link.
+// Looking at the open file would close that gap, but SQLite does not give its descriptor away, and
+// with a second one of our own we would drop SQLite's locks on closing it.
 
 #include "statora/Sqlite.h"
 
 #include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
+#include <system_error>
 #include <utility>
 
 namespace tessel {
@@ -82,20 +94,85 @@ std::string immutableUri(const std::string& path) {
   return uri + "?immutable=1";
 }
 
+const char* kindWords(mode_t mode) {
+  if (S_ISDIR(mode)) return "a directory";
+  if (S_ISLNK(mode)) return "a link";
+  if (S_ISFIFO(mode)) return "a named pipe";
+  return S_ISSOCK(mode) ? "a socket" : "a device";
+}
+
+// Why we do not open the database; absent if nothing speaks against it. A missing file is no
+// reason: SQLite makes it or says so itself.
+std::optional<std::string> refusal(const std::filesystem::path& path) {
+  struct stat directory {};
+  if (::stat(path.parent_path().c_str(), &directory) != 0) return {};
+  // A journal under that name would be played back into the database, so it counts as well.
+  for (const char* suffix : {"", "-wal", "-shm", "-journal"}) {
+    const std::string name = path.string() + suffix;
+    struct stat facts {};
+    if (::lstat(name.c_str(), &facts) != 0) continue;
+    if (!S_ISREG(facts.st_mode))
+      return name + " is " + kindWords(facts.st_mode) + " and not a regular file";
+    // The forwarder shares the directory with the service through its group. Whoever opens the
+    // database first makes the log and its index, so both may be the forwarder's. In a user
+    // namespace its number is hidden from the service, but the group of a file is not.
+    const bool shared =
+        *suffix != '\0' && (directory.st_mode & S_IWGRP) != 0 && facts.st_gid == directory.st_gid;
+    if (facts.st_uid != directory.st_uid && facts.st_uid != 0 && facts.st_uid != ::geteuid() &&
+        !shared) {
+      return name + " belongs to user " + std::to_string(facts.st_uid) +
+             ", who owns neither its directory nor this process";
+    }
+  }
+  return {};
+}
+
+// Nothing that a client of the database has put into its schema may act here. Each setting that
+// turns something off is there because the schema could otherwise run code of a stranger (triggers,
+// views, functions that SQLite calls unsafe) or make us trust a damaged page.
+void distrustSchema(sqlite3* handle) {
+  constexpr int kOff[] = {SQLITE_DBCONFIG_ENABLE_TRIGGER, SQLITE_DBCONFIG_ENABLE_VIEW,
+                          SQLITE_DBCONFIG_TRUSTED_SCHEMA};
+  for (const int setting : kOff) sqlite3_db_config(handle, setting, 0, nullptr);
+  sqlite3_db_config(handle, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
+  sqlite3_exec(handle, "PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
+  // Far above what our own statements and rows need, far below what could take long or much memory.
+  // The longest rows are a few megabytes.
+  constexpr struct {
+    int limit, value;
+  } kLimits[] = {{SQLITE_LIMIT_LENGTH, 64 << 20},  {SQLITE_LIMIT_SQL_LENGTH, 100'000},
+                 {SQLITE_LIMIT_COLUMN, 100},       {SQLITE_LIMIT_EXPR_DEPTH, 50},
+                 {SQLITE_LIMIT_VDBE_OP, 25'000},   {SQLITE_LIMIT_COMPOUND_SELECT, 10},
+                 {SQLITE_LIMIT_FUNCTION_ARG, 10},  {SQLITE_LIMIT_ATTACHED, 0},
+                 {SQLITE_LIMIT_TRIGGER_DEPTH, 1},  {SQLITE_LIMIT_VARIABLE_NUMBER, 100},
+                 {SQLITE_LIMIT_WORKER_THREADS, 0}, {SQLITE_LIMIT_LIKE_PATTERN_LENGTH, 100}};
+  for (const auto& [limit, value] : kLimits) sqlite3_limit(handle, limit, value);
+}
+
 }  // namespace
 
 SqliteStatus SqliteDatabase::open(const std::string& path, Mode mode) {
   close();
+  // NOFOLLOW refuses a link anywhere in the path. The state directory may well be one, so we
+  // resolve the directory, and only the file's own name must be no link.
+  std::error_code error;
+  std::filesystem::path resolved = std::filesystem::absolute(path, error);
+  if (auto directory = std::filesystem::canonical(resolved.parent_path(), error); !error)
+    resolved = directory / resolved.filename();
+  if (auto reason = refusal(resolved)) return {SQLITE_PERM, std::move(*reason)};
   // No mutex: one thread at a time uses a database.
-  int flags = SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE;
+  int flags = SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE | SQLITE_OPEN_NOFOLLOW;
   if (mode == Mode::readOnly) flags |= SQLITE_OPEN_READONLY;
   if (mode == Mode::readWrite) flags |= SQLITE_OPEN_READWRITE;
   if (mode == Mode::create) flags |= SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
   const bool immutable = mode == Mode::immutable;
   if (immutable) flags |= SQLITE_OPEN_READONLY | SQLITE_OPEN_URI;
-  const std::string name = immutable ? immutableUri(path) : path;
+  const std::string name = immutable ? immutableUri(resolved) : resolved.string();
   const int code = sqlite3_open_v2(name.c_str(), &handle_, flags, nullptr);
-  if (code == SQLITE_OK) return {};
+  if (code == SQLITE_OK) {
+    distrustSchema(handle_);
+    return {};
+  }
   // A failed open leaves a handle, which holds the reason and must be closed all the same.
   SqliteStatus failure = status();
   failure.code = code;

@@ -66,6 +66,12 @@ class SqliteDatabase {
   SqliteDatabase& operator=(const SqliteDatabase&) = delete;
   ~SqliteDatabase() { close(); }
 
+  // Opens without waiting for anybody. Fails with SQLITE_PERM if one of the files under these names
+  // is no regular file or belongs to a stranger; the reason names the file. A stranger is any user
+  // but root, this process' own and the owner of the directory. The write-ahead log and its index
+  // may also belong to a member of the group that may write to the directory.
+  //
+  // A trigger or a view in the database never runs, and nothing in its schema is trusted.
   SqliteStatus open(const std::string& path, Mode mode);
   bool isOpen() const { return handle_ != nullptr; }
   void close();

@@ -1,7 +1,7 @@
 // events: what the spool holds, newest last.
 //
-// We read the database beside the service and never write to it. Rows are printed as they are read,
-// so a spool of many megabytes needs no more memory than one row, or than those that -n asks for.
+// We read the database beside the service and never write to it. Rows are printed page by page, so
+// a spool of many megabytes needs no more memory than a page, or than the rows that -n asks for.
 
 #include <chrono>
 #include <deque>
@@ -46,11 +46,11 @@ class RowSelection {
   RowSelection(const EventsOptions& options, std::optional<Period> period)
       : options_(options), period_(period) {}
 
-  bool wants(const SpoolRow& row) const {
+  bool wants(const SpooledEvent& row) const {
     const Date date{std::chrono::microseconds{row.time}};
     // The end is not in the period, so two periods that touch never share a row.
     if (period_ && (date < period_->start || date >= period_->end)) return false;
-    if (!fitsOne(options_.names, std::string(row.name))) return false;
+    if (!fitsOne(options_.names, row.name)) return false;
     // Parsing costs more than all other tests. It comes last, and only if a pattern needs it.
     if (options_.subsystems.empty() && options_.categories.empty()) return true;
     const Json payload = parsed(row.payload);
@@ -63,7 +63,7 @@ class RowSelection {
   const std::optional<Period> period_;
 };
 
-std::string rowJson(const SpoolRow& row) {
+std::string rowJson(const SpooledEvent& row) {
   return objectLine([&](JsonWriter& json) {
     json.member("id", row.id).member("time", row.time).member("name", row.name);
     // Any writer of the spool may have made this row. A payload that is no JSON would break the
@@ -105,7 +105,7 @@ std::string shownName(std::string_view name) {
 
 constexpr size_t kEventWidth = 24;
 
-std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
+std::string humanLine(const SpooledEvent& row, const Terminal& terminal) {
   std::string name = shortened(shownName(row.name), kEventWidth);
   name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
   const std::string time = dateText(Date{std::chrono::microseconds{row.time}}).substr(5);
@@ -150,6 +150,7 @@ class EventsRun {
         printError("Run tesselctl as root, or as the user that the service runs as.\n");
         return kNoAccess;
       default:
+        if (!spool_.damaged()) return fail(kBad, "the spool cannot be read: " + spool_.reason());
         fail(kBad, "the spool is damaged: " + spool_.reason());
         printError("The service sets it aside in its next run and begins a new one.\n");
         return kBad;
@@ -161,18 +162,17 @@ class EventsRun {
   bool show() {
     std::deque<std::string> last;
     const bool limited = options_.newest != 0;
-    const bool read = spool_.readNew([&](const SpoolRow& row) {
-      if (!selection_.wants(row)) return true;
+    const bool read = spool_.readNew([&](const SpooledEvent& row) {
+      if (!selection_.wants(row)) return;
       std::string line = options_.json ? rowJson(row) : humanLine(row, terminal_);
       if (!limited || followed_) {
         print(line);
-        return true;
+        return;
       }
       // The number of rows is not known before the last one is read, so we keep the newest lines
       // and drop the oldest of them. Memory stays bounded by -n.
       last.push_back(std::move(line));
       if (last.size() > options_.newest) last.pop_front();
-      return true;
     });
     for (const std::string& line : last) print(line);
     // With --follow a reader of the pipe waits for these rows. A buffer would hold them back.
@@ -184,11 +184,12 @@ class EventsRun {
     followed_ = true;
     for (;;) {
       std::this_thread::sleep_for(kLookForRowsEvery);
-      const SpoolReader::State state = spool_.open();
-      if (state == SpoolReader::State::noAccess) return complain(state);
-      // The service sets a damaged spool aside in its next run and then makes a new one. So we wait
-      // for it. A refused access does not mend itself.
-      if (state == SpoolReader::State::open) show();
+      // A spool may go and come back: the service replaces a damaged one. A damaged spool stays
+      // what it is until the next run, which may be a day away, so nobody should wait for that.
+      SpoolReader::State state = spool_.open();
+      if (state == SpoolReader::State::absent) continue;
+      if (state == SpoolReader::State::open && !show()) state = SpoolReader::State::damaged;
+      if (state != SpoolReader::State::open && !spool_.locked()) return complain(state);
     }
   }
 

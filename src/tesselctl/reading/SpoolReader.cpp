@@ -7,7 +7,6 @@
 
 #include "tesselctl/reading/SpoolReader.h"
 
-#include <fcntl.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
 
@@ -30,9 +29,12 @@ uint64_t sizeOf(const std::string& path) {
 
 // SQLite says "cannot open" if it may not make its files, so that code means a refusal as well.
 bool forbids(const SqliteStatus& status) {
-  const int code = status.primaryCode();
-  return code == SQLITE_CANTOPEN || code == SQLITE_PERM || code == SQLITE_READONLY;
+  return status.primaryCode() == SQLITE_CANTOPEN || status.primaryCode() == SQLITE_READONLY;
 }
+
+// How much of the spool is in memory at a time. A page ends with the row that reaches the bytes.
+constexpr size_t kRowsOfAPage = 512;
+constexpr size_t kBytesOfAPage = size_t{1} << 20;
 
 }  // namespace
 
@@ -42,16 +44,16 @@ SpoolReader::SpoolReader(const std::string& stateDirectory)
 // The service sets a damaged spool aside by renaming it. Our database would still be the old one.
 bool SpoolReader::sameFile() const {
   struct stat facts {};
-  return ::stat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
+  return ::lstat(path_.c_str(), &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_;
 }
 
 SpoolReader::State SpoolReader::open() {
   if (database_.isOpen() && sameFile()) return State::open;
   database_.close();
   lastId_ = 0;
-  const UniqueFd file(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  failure_ = {};
   struct stat facts {};
-  if (!file.valid() || ::fstat(file.get(), &facts) != 0) {
+  if (::lstat(path_.c_str(), &facts) != 0) {
     const PlatformError error = fileError(path_, errno);
     reason_ = error.words;
     return error.code == ErrorCode::notFound   ? State::absent
@@ -63,45 +65,52 @@ SpoolReader::State SpoolReader::open() {
   return openDatabase();
 }
 
-SpoolReader::State SpoolReader::openDatabase() {
-  SqliteStatus status = database_.open(path_, SqliteDatabase::Mode::readOnly);
-  if (status.ok()) {
-    database_.setBusyTimeout(kBusyMilliseconds);
-    // Opening reads nothing yet. Only a query shows whether this is a spool.
-    if (database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)"))
-      return State::open;
-    status = database_.status();
-    database_.close();
-  }
-  // An empty log, or none, means that the database itself holds every row.
-  if (forbids(status) && sizeOf(path_ + "-wal") == 0) {
-    status = database_.open(path_, SqliteDatabase::Mode::immutable);
-    if (status.ok() && database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)"))
-      return State::open;
-    if (status.ok()) status = database_.status();
-    database_.close();
-  }
-  reason_ = path_ + ": " + status.reason;
-  return forbids(status) ? State::noAccess : State::damaged;
+SqliteStatus SpoolReader::openAs(SqliteDatabase::Mode mode) {
+  SqliteStatus status = database_.open(path_, mode);
+  if (!status.ok()) return status;
+  database_.setBusyTimeout(kBusyMilliseconds);
+  // Opening reads nothing yet. Only a query shows whether this is a spool.
+  return database_.integer("SELECT count(*) FROM (SELECT 1 FROM events LIMIT 1)")
+             ? SqliteStatus{}
+             : database_.status();
 }
 
-bool SpoolReader::readNew(const std::function<bool(const SpoolRow&)>& visit) {
-  SqliteStatement rows =
-      database_.prepare("SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id");
-  if (rows.prepared()) {
-    rows.bind(1, lastId_);
-    for (;;) {
-      const SqliteStatement::Step step = rows.step();
-      if (step == SqliteStatement::Step::done) return true;
-      if (step == SqliteStatement::Step::failed) break;
-      const SpoolRow row{rows.integer(0), rows.integer(1), rows.text(2), rows.text(3)};
-      // We note the row before the visitor sees it. A visitor that ends the reading has had this
-      // row, so the next call starts behind it.
-      lastId_ = row.id;
-      if (!visit(row)) return true;
-    }
+SpoolReader::State SpoolReader::openDatabase() {
+  failure_ = openAs(SqliteDatabase::Mode::readOnly);
+  // An empty log, or none, means that the database itself holds every row.
+  if (forbids(failure_) && sizeOf(path_ + "-wal") == 0)
+    failure_ = openAs(SqliteDatabase::Mode::immutable);
+  if (failure_.ok()) return State::open;
+  // The service makes the file first and its tables a moment later. A file without any table is no
+  // spool yet.
+  const bool empty = failure_.primaryCode() == SQLITE_ERROR &&
+                     database_.integer("SELECT count(*) FROM sqlite_schema") == 0;
+  database_.close();
+  reason_ = path_ + ": " + failure_.reason;
+  if (empty) return State::absent;
+  return forbids(failure_) ? State::noAccess : State::damaged;
+}
+
+bool SpoolReader::damaged() const {
+  return failure_.primaryCode() == SQLITE_CORRUPT || failure_.primaryCode() == SQLITE_NOTADB;
+}
+
+bool SpoolReader::locked() const { return failure_.primaryCode() == SQLITE_BUSY; }
+
+bool SpoolReader::readNew(const std::function<void(const SpooledEvent&)>& visit) {
+  failure_ = {};
+  SqliteStatement select = database_.prepare(kSelectEvents);
+  while (select.prepared()) {
+    const auto page = readEvents(select, lastId_, kRowsOfAPage, kBytesOfAPage);
+    // The visitor is no client of this database, so the status is still that of the reading.
+    failure_ = database_.status();
+    for (const SpooledEvent& row : page) visit(row);
+    if (!page.empty()) lastId_ = page.back().id;
+    if (!failure_.ok()) break;
+    if (page.empty()) return true;
   }
-  reason_ = path_ + ": " + database_.status().reason;
+  if (failure_.ok()) failure_ = database_.status();
+  reason_ = path_ + ": " + failure_.reason;
   return false;
 }
 

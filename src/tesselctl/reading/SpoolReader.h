@@ -11,19 +11,11 @@
 #include <functional>
 #include <optional>
 #include <string>
-#include <string_view>
 
 #include "statora/ForwarderState.h"
 #include "statora/Sqlite.h"
 
 namespace tessel::ctl {
-
-struct SpoolRow {
-  int64_t id = 0;
-  int64_t time = 0;  // microseconds since 1970
-  std::string_view name;
-  std::string_view payload;
-};
 
 // What a spool holds.
 struct SpoolContents {
@@ -47,14 +39,21 @@ class SpoolReader {
   // Why it is not open, in words.
   const std::string& reason() const { return reason_; }
 
-  // Calls `visit` with each row behind those of earlier calls, oldest first, until it answers
-  // false. The row is borrowed. False, with a reason, where the spool cannot be read.
-  bool readNew(const std::function<bool(const SpoolRow&)>& visit);
+  // Whether the service will set the spool aside, because what it holds is damaged.
+  bool damaged() const;
+  // Whether another program holds the spool locked. That ends by itself.
+  bool locked() const;
+
+  // Calls `visit` with each row behind those of earlier calls, oldest first. `visit` may take as
+  // long as it likes: the spool is read page by page and not held meanwhile. False, with a reason,
+  // where the spool cannot be read.
+  bool readNew(const std::function<void(const SpooledEvent&)>& visit);
   // Nothing, with a reason, where the spool cannot be read.
   std::optional<SpoolContents> contents();
 
  private:
   State openDatabase();
+  SqliteStatus openAs(SqliteDatabase::Mode mode);
   bool sameFile() const;
 
   const std::string path_;
@@ -62,6 +61,7 @@ class SpoolReader {
   dev_t device_ = 0;
   ino_t inode_ = 0;
   int64_t lastId_ = 0;
+  SqliteStatus failure_;
   std::string reason_;
 };
 
