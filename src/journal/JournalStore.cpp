@@ -79,6 +79,10 @@ void SequenceWatch::change(const EntryHeader& entry) {
 // Two files with equal keys would return each other's tokens.
 static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
 
+// One call in 64 entries does not show in the time of a run. The watchdog waits minutes, so entries
+// may take a second each, as from a disk that fails.
+constexpr uint64_t kEntriesPerStep = 64;
+
 // For a stream whose entries may belong to any sequence.
 constexpr Id128 kNoSequence{};
 
@@ -100,8 +104,9 @@ void addFile(const FileReport& file, StoreReading& reading) {
 }  // namespace
 
 struct JournalStore::State final : EntryStream {
-  State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag)
-      : range(timeRange), stop(stopFlag), tokenizer(user), merger(stopFlag) {
+  State(TimeRange timeRange, FieldTokenizer& user, const StopFlag& stopFlag,
+        ServiceStatus* serviceStatus)
+      : range(timeRange), stop(stopFlag), status(serviceStatus), tokenizer(user), merger(stopFlag) {
     facts.reading.rangeStart = range.start;
   }
 
@@ -115,6 +120,9 @@ struct JournalStore::State final : EntryStream {
   void openForeign(StoreFile& file, uint64_t entryCount, uint32_t number);
   bool outsideRange(const JournalHeader& header) const;
   std::optional<PlatformError> failure(const std::string& place) const;
+  void makeProgress() const {
+    if (status != nullptr) status->progress();
+  }
   void seeTime(uint64_t realtime) {
     auto& oldest = facts.reading.oldestEntry;
     if (!oldest || realtime < *oldest) oldest = realtime;
@@ -122,6 +130,8 @@ struct JournalStore::State final : EntryStream {
 
   const TimeRange range;
   const StopFlag& stop;
+  ServiceStatus* const status;
+  uint64_t entriesMerged = 0;
   JournalReadResources resources;
   ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
@@ -137,6 +147,7 @@ struct JournalStore::State final : EntryStream {
 bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
+    if (++entriesMerged % kEntriesPerStep == 0) makeProgress();
     // Entries outside the range count too: they show how far back the store reaches, and without
     // them their numbers would look like gaps.
     sequences.see(entry);
@@ -163,6 +174,7 @@ void JournalStore::State::openFiles(StoreFiles found) {
                            found.leftOut);
   facts.files.resize(found.files.size());
   for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
+    makeProgress();
     facts.files[i].path = found.files[i].path;
     openFile(found.files[i], i);
   }
@@ -266,11 +278,11 @@ JournalStore::~JournalStore() = default;
 
 std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
     const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
-    const StopFlag& stop) {
-  auto found = openStoreFiles(path, kMaxFiles, stop);
+    const StopFlag& stop, ServiceStatus* status) {
+  auto found = openStoreFiles(path, kMaxFiles, stop, status);
   if (auto* error = std::get_if<PlatformError>(&found)) return std::move(*error);
   const std::string place = path.value_or("the machine's journal");
-  auto state = std::make_unique<State>(range, tokenizer, stop);
+  auto state = std::make_unique<State>(range, tokenizer, stop, status);
   state->openFiles(std::get<StoreFiles>(std::move(found)));
   if (auto error = state->failure(place)) return std::move(*error);
   return std::unique_ptr<JournalStore>(new JournalStore(std::move(state)));

@@ -16,6 +16,7 @@
 #include "journal/EntryStream.h"
 #include "journal/StoreReport.h"
 #include "platform/Error.h"
+#include "platform/System.h"
 
 namespace tessel {
 
@@ -37,11 +38,12 @@ class JournalStore {
 
   // Opens the store at `path`; without a path, the journal of this machine. An error has a code and
   // names the path: notFound, noAccess, notAStore (no file there is a journal), or failed. A
-  // damaged file among good ones is no error; the report tells of it. `tokenizer` and `stop` must
-  // outlive the store.
+  // damaged file among good ones is no error; the report tells of it. `status` may be null. It gets
+  // the progress: each file that is opened, and every few entries. All references must outlive the
+  // store.
   static std::variant<std::unique_ptr<JournalStore>, PlatformError> open(
       const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
-      const StopFlag& stop);
+      const StopFlag& stop, ServiceStatus* status = nullptr);
 
   ~JournalStore();
   JournalStore(const JournalStore&) = delete;

@@ -34,7 +34,8 @@ std::optional<StoreFileKind> kindOf(std::string_view name) {
 
 class Finder {
  public:
-  Finder(size_t limit, const StopFlag& stop) : limit_(limit), stop_(stop) {}
+  Finder(size_t limit, const StopFlag& stop, ServiceStatus* status)
+      : limit_(limit), stop_(stop), status_(status) {}
 
   // Lists `directory` until a listing shows nothing new. Returns 0, or errno if it cannot be read.
   int addDirectory(const std::string& directory);
@@ -48,6 +49,7 @@ class Finder {
 
   const size_t limit_;
   const StopFlag& stop_;
+  ServiceStatus* const status_;
   StoreFiles found_;
   std::set<std::pair<dev_t, ino_t>> known_;
   std::vector<StoreFile> failed_;  // files that the current listing could not open
@@ -107,6 +109,7 @@ void Finder::addFile(const std::string& path, StoreFileKind kind) {
     if (errno != ENOENT) fail(path, kind, errno);
     return;
   }
+  if (status_ != nullptr) status_->progress();
   struct stat status {};
   if (::fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return;
   // One file can have two names, by a hard or symbolic link or a rename between two listings. We
@@ -171,14 +174,15 @@ std::string whyNotOpened(int error) {
 }
 
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
-                                                       size_t limit, const StopFlag& stop) {
+                                                       size_t limit, const StopFlag& stop,
+                                                       ServiceStatus* progress) {
   constexpr size_t kOtherFiles = 256;  // descriptors for everything else in the process
   // Every file of the store stays open. The usual soft limit of 1,024 protects programs that use
   // select(); we do not, so we raise it. Where the hard limit is too low, we look at fewer files.
   // If the store took every descriptor, the spool could not be opened and all rows would be lost.
   const size_t allowed = allowDescriptors(limit + kOtherFiles);
   const size_t forStore = allowed > 2 * kOtherFiles ? allowed - kOtherFiles : allowed / 2;
-  Finder finder(std::min(limit, forStore), stop);
+  Finder finder(std::min(limit, forStore), stop, progress);
   if (!path) return machineJournal(finder);
   struct stat status {};
   if (::stat(path->c_str(), &status) != 0) return storeError(*path, errno);

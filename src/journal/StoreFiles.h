@@ -18,6 +18,7 @@
 #include "journal/EntryStream.h"
 #include "os/UniqueFd.h"
 #include "platform/Error.h"
+#include "platform/System.h"
 
 namespace tessel {
 
@@ -37,9 +38,10 @@ struct StoreFiles {
 
 // Opens the files at `path`, which is a directory or one file; without a path, the files of this
 // machine's journal. Opens at most `limit` files. Returns an error if there is no such place or it
-// cannot be read.
+// cannot be read. Each file that it opens is a step for `progress`, which may be null.
 std::variant<StoreFiles, PlatformError> openStoreFiles(const std::optional<std::string>& path,
-                                                       size_t limit, const StopFlag& stop);
+                                                       size_t limit, const StopFlag& stop,
+                                                       ServiceStatus* progress);
 
 // Describes the errno `error`. If access was denied, the text also says who has access.
 std::string whyNotOpened(int error);

@@ -36,6 +36,8 @@ constexpr struct {
     {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
     {"A file in the state directory is not used: ", "dc9f4449558a4b44b8db8d735db6a79b"},
     {"The record of the run is not written: ", "5ec5b861dea7400ab6f514dfd29986f8"},
+    {"The run is put off: ", "5404ba8a07bf4b149c0e56928bae46cd"},
+    {"The run is stopped early: ", "68f8b03461d34a78a9b19699e316cfc7"},
 };
 
 struct LevelNames {

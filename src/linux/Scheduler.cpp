@@ -22,12 +22,11 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <atomic>
 #include <charconv>
 #include <filesystem>
-#include <mutex>
 #include <system_error>
 #include <utility>
-#include <vector>
 
 #include "os/Files.h"
 #include "platform/Log.h"
@@ -92,11 +91,30 @@ DeferralConditions::DeferralConditions(DeferSources sources, std::string deferFi
       powerSupplyDirectory_(std::move(powerSupplyDirectory)),
       pressureFile_(std::move(pressureFile)) {}
 
-std::optional<std::string> DeferralConditions::reason() const {
-  if (sources_.file && deferFileExists()) return deferFile_ + " exists";
-  if (sources_.battery && batteryIsLow()) return "the battery is low";
-  if (sources_.pressure && cpuIsUnderPressure()) return "the CPU is under pressure";
-  return {};
+DeferReason DeferralConditions::byFile() const {
+  return sources_.file && deferFileExists() ? DeferReason::file : DeferReason::none;
+}
+
+DeferReason DeferralConditions::byMachine() const {
+  if (sources_.battery && batteryIsLow()) return DeferReason::battery;
+  if (sources_.pressure && cpuIsUnderPressure()) return DeferReason::pressure;
+  return DeferReason::none;
+}
+
+std::string DeferralConditions::words(DeferReason reason) const {
+  switch (reason) {
+    case DeferReason::none:
+      break;
+    case DeferReason::file:
+      return deferFile_ + " exists";
+    case DeferReason::battery:
+      return "the battery is low";
+    case DeferReason::pressure:
+      return "the CPU is under pressure";
+    case DeferReason::runLimit:
+      return "it has taken as long as TESSEL_RUN_LIMIT allows";
+  }
+  return "no reason";
 }
 
 bool DeferralConditions::deferFileExists() const {
@@ -129,36 +147,72 @@ namespace {
 // slept, so both clocks are read again this often.
 constexpr std::chrono::nanoseconds kLongestWait = std::chrono::minutes{1};
 
-// One delivery to the activity. Several threads of the service use it, hence the lock. After end()
-// it takes no state any more, because nobody would act on it.
+std::chrono::nanoseconds timeSince(uint64_t ticks, Clock& clock) {
+  const Timebase base = clock.timebase();
+  const uint64_t nanoseconds =
+      (clock.continuousTicks() - ticks) * base.numerator / base.denominator;
+  return std::chrono::nanoseconds{static_cast<int64_t>(nanoseconds)};
+}
+
+// One delivery to the activity. Several threads of the service use it at the same time. The poll of
+// a run keeps it for as long as the process lives, hence atomics: a mutex would be the largest part
+// of what a past run costs. After end() it takes no state any more and never wants a deferral,
+// because the slot has been given back.
 class Delivery final : public Activity {
  public:
-  Delivery(int64_t state, const DeferralConditions& conditions)
-      : conditions_(conditions), state_(state) {}
+  Delivery(int64_t state, const DeferralConditions& conditions, Clock& clock,
+           std::chrono::seconds runLimit, bool machineMayDefer)
+      : conditions_(conditions),
+        clock_(clock),
+        begin_(clock.continuousTicks()),
+        runLimit_(runLimit),
+        state_(state),
+        machineMayDefer_(machineMayDefer) {}
 
-  int64_t state() override {
-    const std::lock_guard lock(mutex_);
-    return state_;
-  }
-  bool shouldDefer() override { return conditions_.reason().has_value(); }
-  bool setState(int64_t wanted) override {
-    const std::lock_guard lock(mutex_);
-    if (over_ || state_ != kActivityStateRun || wanted != kActivityStateDefer) return false;
-    state_ = wanted;
+  int64_t state() override { return state_ & ~kOver; }
+  bool shouldDefer() override {
+    if ((state_ & kOver) != 0) return false;
+    // The first question comes before the run begins, and all others from the run.
+    const bool begun = asked_.exchange(true);
+    const DeferReason reason = begun ? reasonToStop() : reasonToWait();
+    if (reason == DeferReason::none) return false;
+    const DeferReason before = reason_.exchange(reason);
+    if (begun && before != reason)
+      platformLog().warning("The run is stopped early: %@", conditions_.words(reason));
     return true;
   }
-  // Makes every later setState() fail. True if the run was deferred.
-  bool end() {
-    const std::lock_guard lock(mutex_);
-    over_ = true;
-    return state_ == kActivityStateDefer;
+  bool setState(int64_t wanted) override {
+    int64_t expected = kActivityStateRun;
+    return wanted == kActivityStateDefer && state_.compare_exchange_strong(expected, wanted);
+  }
+  // Makes every later setState() fail. Answers why the run was deferred, or nothing if it was not.
+  std::optional<DeferReason> end() {
+    if (state_.fetch_or(kOver) != kActivityStateDefer) return {};
+    return reason_;
   }
 
  private:
+  static constexpr int64_t kOver = 256;  // a bit that no state has
+
+  DeferReason reasonToWait() const {
+    const DeferReason reason = conditions_.byFile();
+    if (reason != DeferReason::none || !machineMayDefer_) return reason;
+    return conditions_.byMachine();
+  }
+  DeferReason reasonToStop() const {
+    const DeferReason reason = conditions_.byFile();
+    if (reason != DeferReason::none || runLimit_.count() == 0) return reason;
+    return timeSince(begin_, clock_) > runLimit_ ? DeferReason::runLimit : DeferReason::none;
+  }
+
   const DeferralConditions& conditions_;
-  std::mutex mutex_;
-  int64_t state_;
-  bool over_ = false;
+  Clock& clock_;
+  const uint64_t begin_;
+  const std::chrono::seconds runLimit_;
+  std::atomic<int64_t> state_;
+  const bool machineMayDefer_;
+  std::atomic<bool> asked_{false};
+  std::atomic<DeferReason> reason_{DeferReason::none};
 };
 
 }  // namespace
@@ -194,28 +248,56 @@ ActivityDeliveries::ActivityDeliveries(ScheduleCriteria criteria, const StateDir
       conditions_(conditions),
       status_(status),
       clock_(clock),
-      handler_(std::move(handler)) {}
+      handler_(std::move(handler)),
+      putOffByMachine_(state.putOff()) {}
 
 void ActivityDeliveries::deliverCheckIn() {
-  const auto delivery = std::make_shared<Delivery>(kActivityStateCheckIn, conditions_);
+  const auto delivery = std::make_shared<Delivery>(kActivityStateCheckIn, conditions_, clock_,
+                                                   criteria_.runLimit, false);
   handler_(delivery);
   delivery->end();
 }
 
 bool ActivityDeliveries::deliverRun() {
   std::optional<RunLock> turn = waitForTurn();
+  recordPutOff(putOffByMachine_);
   const Date begin = clock_.now();
-  const auto delivery = std::make_shared<Delivery>(kActivityStateRun, conditions_);
+  const auto delivery = std::make_shared<Delivery>(kActivityStateRun, conditions_, clock_,
+                                                   criteria_.runLimit, machineMayDefer());
   handler_(delivery);
-  if (delivery->end()) {
+  if (const std::optional<DeferReason> reason = delivery->end()) {
     // Give the lock back before the wait, so that another process can run meanwhile.
     turn.reset();
-    status_.say("run deferred: " + conditions_.reason().value_or("no reason any more"));
-    waitForRetry();
+    putOff(*reason);
     return true;
   }
   record(begin);
   return criteria_.interval.has_value();
+}
+
+void ActivityDeliveries::putOff(DeferReason reason) {
+  status_.say("run deferred: " + conditions_.words(reason));
+  warnOnce(reason);
+  if (!isOfTheMachine(reason)) return waitFor(criteria_.deferRetry);
+  const uint64_t begin = clock_.continuousTicks();
+  // The last wait is cut, so that the run begins when the limit is reached and not a retry later.
+  waitFor(std::min<std::chrono::nanoseconds>(criteria_.deferRetry,
+                                             criteria_.deferLimit - putOffByMachine_));
+  putOffByMachine_ += timeSince(begin, clock_);
+}
+
+// The process may end while a run waits, for example when the machine is switched off. Without a
+// record, a machine that is never on for two hours would never report. Only the holder of the lock
+// writes it. If that fails, the next process counts from the last record on.
+void ActivityDeliveries::recordPutOff(std::chrono::nanoseconds time) {
+  const auto seconds = std::chrono::ceil<std::chrono::seconds>(time);
+  if (state_.putOff() != seconds) state_.recordPutOff(seconds);
+}
+
+void ActivityDeliveries::warnOnce(DeferReason reason) {
+  if (std::find(warnedOf_.begin(), warnedOf_.end(), reason) != warnedOf_.end()) return;
+  warnedOf_.push_back(reason);
+  platformLog().warning("The run is put off: %@", conditions_.words(reason));
 }
 
 RunLock ActivityDeliveries::waitForTurn() {
@@ -224,7 +306,7 @@ RunLock ActivityDeliveries::waitForTurn() {
     std::optional<RunLock> turn = waitForLock();
     if (!turn) {
       tesselReporterLog().debug("Could not lock the state directory %@", state_.path());
-      waitForRetry();
+      waitFor(criteria_.deferRetry);
     } else if (!criteria_.interval || lastRun() == lastRunSeen) {
       return std::move(*turn);
     }
@@ -246,7 +328,7 @@ std::optional<Date> ActivityDeliveries::waitUntilDue() {
   const uint64_t begin = clock_.continuousTicks();
   for (;;) {
     const std::chrono::nanoseconds remaining =
-        waitForRun(seen, clock_.now(), *criteria_.interval, since(begin));
+        waitForRun(seen, clock_.now(), *criteria_.interval, timeSince(begin, clock_));
     if (remaining.count() == 0) return seen;
     status_.say("waiting until the next run is due");
     wait(std::min(remaining, kLongestWait));
@@ -261,15 +343,18 @@ std::optional<Date> ActivityDeliveries::lastRun() const {
 
 void ActivityDeliveries::record(Date begin) {
   lastRunHere_ = begin;
+  warnedOf_.clear();
+  putOffByMachine_ = {};
+  recordPutOff(putOffByMachine_);
   if (const auto error = state_.recordRun(begin)) {
     tesselReporterLog().debug("Could not record the run: %@", error->words);
   }
 }
 
-void ActivityDeliveries::waitForRetry() {
+void ActivityDeliveries::waitFor(std::chrono::nanoseconds duration) {
   const uint64_t begin = clock_.continuousTicks();
   for (;;) {
-    const std::chrono::nanoseconds remaining = criteria_.deferRetry - since(begin);
+    const std::chrono::nanoseconds remaining = duration - timeSince(begin, clock_);
     if (remaining.count() <= 0) return;
     wait(std::min(remaining, kLongestWait));
   }
@@ -279,13 +364,6 @@ void ActivityDeliveries::wait(std::chrono::nanoseconds duration) {
   // Nobody signals the semaphore, so this only sleeps, by a clock that tests can move.
   Semaphore never(0);
   clock_.wait(never, duration);
-}
-
-std::chrono::nanoseconds ActivityDeliveries::since(uint64_t ticks) {
-  const Timebase base = clock_.timebase();
-  const uint64_t nanoseconds =
-      (clock_.continuousTicks() - ticks) * base.numerator / base.denominator;
-  return std::chrono::nanoseconds{static_cast<int64_t>(nanoseconds)};
 }
 
 }  // namespace tessel

@@ -5,9 +5,11 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "linux/LaunchConfiguration.h"
 #include "linux/ServiceRuntime.h"
@@ -15,6 +17,20 @@
 #include "platform/System.h"
 
 namespace tessel {
+
+// Why a run must wait, or end before it has read everything.
+enum class DeferReason : uint8_t {
+  none,
+  file,      // the file <state>/defer
+  battery,   // the machine runs on a low battery
+  pressure,  // tasks wait for the CPU
+  runLimit,  // the run has taken too long
+};
+
+// Battery and pressure are the machine's own state. They pass without anybody's help, or never.
+constexpr bool isOfTheMachine(DeferReason reason) {
+  return reason == DeferReason::battery || reason == DeferReason::pressure;
+}
 
 // Says whether now is a bad time for a run. It reads files at the moment it is asked. A service
 // that waits for ever would be worse than one that runs at a bad time. So a file that is missing or
@@ -27,8 +43,12 @@ class DeferralConditions {
                      std::string powerSupplyDirectory = "/sys/class/power_supply",
                      std::string pressureFile = "/proc/pressure/cpu");
 
-  // Why a run should wait, in words. Absent if it need not.
-  std::optional<std::string> reason() const;
+  // Whether the defer file wants a run to wait or to stop.
+  DeferReason byFile() const;
+  // Whether the state of the machine wants a run to wait.
+  DeferReason byMachine() const;
+  // The reason for people. It goes after a colon.
+  std::string words(DeferReason reason) const;
 
  private:
   bool deferFileExists() const;
@@ -58,6 +78,8 @@ inline std::chrono::nanoseconds waitForRun(std::optional<Date> lastRun, Date now
 struct ScheduleCriteria {
   std::optional<std::chrono::seconds> interval;  // absent: one run, then nothing is pending
   std::chrono::seconds deferRetry{900};
+  std::chrono::seconds runLimit{21'600};  // zero: no limit
+  std::chrono::seconds deferLimit{7200};  // of what the machine may put one run off, in all
 };
 
 // Delivers the check-in and then runs to the one activity of the process.
@@ -66,6 +88,17 @@ struct ScheduleCriteria {
 // whenever that much time has passed since the last run began. While its run is being delivered, an
 // activity may set its state to "defer", once; it takes no other state. A deferred run is delivered
 // again after the retry time.
+//
+// An activity asks whether to defer once before its run begins, and after that while the run is
+// under way. What the answer goes by:
+//
+//                        before the run                      under way
+//   the defer file       as long as it stands                as long as it stands
+//   battery, pressure    until they have put the run off     never: whoever keeps the machine busy
+//                        for `deferLimit` in all             must not be able to stop every run
+//   the run limit        -                                   once the run has taken that long
+//
+// Each reason for which a run waits or stops is one warning in the log.
 //
 // Threads: registerActivity() makes one thread, which calls the handler and lives as long as
 // something is pending. The scheduler and everything given to its constructor live as long as the
@@ -106,9 +139,12 @@ class ActivityDeliveries {
   std::optional<Date> waitUntilDue();
   std::optional<Date> lastRun() const;
   void record(Date begin);
-  void waitForRetry();
+  void putOff(DeferReason reason);
+  void recordPutOff(std::chrono::nanoseconds time);
+  bool machineMayDefer() const { return putOffByMachine_ < criteria_.deferLimit; }
+  void warnOnce(DeferReason reason);
+  void waitFor(std::chrono::nanoseconds duration);
   void wait(std::chrono::nanoseconds duration);
-  std::chrono::nanoseconds since(uint64_t ticks);
 
   const ScheduleCriteria criteria_;
   const StateDirectory& state_;
@@ -117,6 +153,10 @@ class ActivityDeliveries {
   Clock& clock_;
   const ActivityHandler handler_;
   std::optional<Date> lastRunHere_;  // the last run of this process; recording it may have failed
+  // How long battery and pressure have put off the run that is due. It includes what earlier
+  // processes recorded.
+  std::chrono::nanoseconds putOffByMachine_;
+  std::vector<DeferReason> warnedOf_;  // for the run that is due
 };
 
 }  // namespace tessel

@@ -57,6 +57,7 @@ void blockSignal(int signalNumber) {
 void prepareProcess() {
   blockSignal(SIGINT);
   std::signal(SIGPIPE, SIG_IGN);
+  std::signal(SIGXFSZ, SIG_IGN);
   fillStandardDescriptors();
   keepHeapSmall();
 }
@@ -64,6 +65,10 @@ void prepareProcess() {
 namespace {
 // The manager advises two signs of life a period. With four, one or two late ones do no harm.
 constexpr int kFeedsPerWatchdogPeriod = 4;
+
+// A disk that is busy for others answers within seconds. One that has not answered for a minute may
+// never do so, and then only a restart helps.
+constexpr std::chrono::seconds kLongestHonestWait{60};
 }  // namespace
 
 ServiceManager::ServiceManager(Clock& clock, Notify notify, std::chrono::nanoseconds watchdog)
@@ -87,20 +92,32 @@ void ServiceManager::say(std::string_view words) {
 }
 
 void ServiceManager::progress() {
-  if (feedInterval_.count() > 0 && takeFeed()) notify_("WATCHDOG=1");
+  if (feedInterval_.count() == 0) return;
+  const uint64_t now = clock_.continuousTicks();
+  lastProgress_.store(now, std::memory_order_relaxed);
+  feed(now);
 }
 
-// True once per feed interval, for one caller only. It has no lock, because a run calls it for
+void ServiceManager::standInForProgress() {
+  if (feedInterval_.count() == 0) return;
+  const uint64_t now = clock_.continuousTicks();
+  if (now <= lastProgress_.load(std::memory_order_relaxed) + ticksOf(kLongestHonestWait)) feed(now);
+}
+
+uint64_t ServiceManager::ticksOf(std::chrono::nanoseconds time) const {
+  const Timebase base = clock_.timebase();
+  return static_cast<uint64_t>(time.count()) * base.denominator / base.numerator;
+}
+
+// Sends once per feed interval, for one caller only. It has no lock, because a run calls it for
 // every trace object. Relaxed order is enough, because the threads share nothing but this one
 // number.
-bool ServiceManager::takeFeed() {
-  const Timebase base = clock_.timebase();
-  const uint64_t now = clock_.continuousTicks();
+void ServiceManager::feed(uint64_t now) {
   uint64_t due = nextFeed_.load(std::memory_order_relaxed);
-  if (now < due) return false;
-  const uint64_t interval =
-      static_cast<uint64_t>(feedInterval_.count()) * base.denominator / base.numerator;
-  return nextFeed_.compare_exchange_strong(due, now + interval, std::memory_order_relaxed);
+  if (now < due) return;
+  if (nextFeed_.compare_exchange_strong(due, now + ticksOf(feedInterval_),
+                                        std::memory_order_relaxed))
+    notify_("WATCHDOG=1");
 }
 
 std::unique_ptr<ServiceManager> connectServiceManager(Clock& clock) {
@@ -195,6 +212,8 @@ bool ServiceRuntime::exitAllowed() const {
   return cleanExitRequested_ && transactions_ == 0 && deliveries_ == 0;
 }
 
+// While work is under way this loop wakes twice per feed interval. The work may have sent the last
+// sign at any moment in between, and then the next one still comes within half a watchdog period.
 void ServiceRuntime::waitUntilExitAllowed() {
   const std::chrono::nanoseconds feedInterval = manager_.feedInterval();
   std::unique_lock lock(mutex_);
@@ -202,10 +221,11 @@ void ServiceRuntime::waitUntilExitAllowed() {
     changed_.wait(lock, [this] { return exitAllowed(); });
     return;
   }
-  while (!changed_.wait_for(lock, feedInterval, [this] { return exitAllowed(); })) {
-    if (transactions_ > 0) continue;  // its work sends the signs of life
+  while (!changed_.wait_for(lock, transactions_ > 0 ? feedInterval / 2 : feedInterval,
+                            [this] { return exitAllowed(); })) {
+    const bool working = transactions_ > 0;
     lock.unlock();
-    manager_.progress();
+    working ? manager_.standInForProgress() : manager_.progress();
     lock.lock();
   }
 }

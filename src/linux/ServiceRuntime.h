@@ -17,7 +17,8 @@ namespace tessel {
 // Prepares the process. Call it first in main(), before any thread exists. It
 //  - blocks SIGINT in this thread and in all later ones, so that an interrupt waits for its signal
 //    source and does not kill the process;
-//  - ignores SIGPIPE, because a log reader that went away is no reason to end;
+//  - ignores SIGPIPE, because a log reader that went away is no reason to end, and SIGXFSZ, because
+//    a file that may not grow is an error of a write like any other;
 //  - opens /dev/null for each standard descriptor that is closed. Otherwise a file that is opened
 //    later would get that number and receive log lines;
 //  - makes the heap give large blocks back, so that an idle process does not keep the memory of its
@@ -46,16 +47,21 @@ class ServiceManager final : public ServiceStatus {
   void say(std::string_view words) override;
   // Sends a sign of life, at most four times per watchdog period.
   void progress() override;
+  // Sends one in the place of work that waits, for a slow disk for example. It does so only for a
+  // minute after the last progress(). A wait that never ends then ends in the watchdog.
+  void standInForProgress();
   // How often a process that has nothing to do should call progress(). Zero: never.
   std::chrono::nanoseconds feedInterval() const { return feedInterval_; }
 
  private:
-  bool takeFeed();
+  uint64_t ticksOf(std::chrono::nanoseconds time) const;
+  void feed(uint64_t now);
 
   Clock& clock_;
   const Notify notify_;
   const std::chrono::nanoseconds feedInterval_;
-  std::atomic<uint64_t> nextFeed_{0};  // continuous ticks
+  std::atomic<uint64_t> lastProgress_{0};  // continuous ticks
+  std::atomic<uint64_t> nextFeed_{0};      // continuous ticks
   std::mutex wordsMutex_;
   std::string words_;
 };
@@ -96,8 +102,8 @@ class ServiceRuntime final : public Runtime {
   std::shared_ptr<SignalSource> makeSignalSource(int signalNumber,
                                                  std::shared_ptr<SerialQueue> queue) override;
   // Tells the manager that the process is ready, waits until it may end, and ends it. While no
-  // transaction is open, this loop sends the signs of life. While one is open, only its work sends
-  // them: otherwise a run that hangs would look alive.
+  // transaction is open, this loop sends the signs of life. While one is open, its work sends them,
+  // and this loop only stands in: otherwise a run that hangs would look alive.
   [[noreturn]] void runMainLoop() override;
 
   // Keeps the process alive until the result is destroyed, because a delivery is pending. Unlike a

@@ -17,6 +17,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <filesystem>
@@ -56,6 +57,19 @@ int makeDirectory(const std::string& path) {
   return S_ISDIR(facts.st_mode) ? 0 : ENOTDIR;
 }
 
+// The number in a record. Absent if there is none or it cannot be understood.
+std::optional<int64_t> recordedNumber(const std::string& path) {
+  const auto content = readOwnFile(path, kMaxRecordSize);
+  const auto* text = std::get_if<std::string>(&content);
+  // A record without its line feed was cut short, so its number may be incomplete.
+  if (text == nullptr || !text->ends_with('\n')) return {};
+  int64_t number = 0;
+  const char* end = text->data() + text->size() - 1;
+  const auto [stopped, error] = std::from_chars(text->data(), end, number);
+  if (error != std::errc() || stopped != end || number < 0) return {};
+  return number;
+}
+
 }  // namespace
 
 // A run as another user, which only root can do, would leave files that all later runs of the owner
@@ -90,20 +104,15 @@ std::optional<RunLock> StateDirectory::tryLock() const { return lock(LOCK_EX | L
 std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX); }
 
 std::optional<Date> StateDirectory::lastRun() const {
-  const auto content = readOwnFile(recordFile(), kMaxRecordSize);
-  const auto* text = std::get_if<std::string>(&content);
-  // A record without its line feed was cut short, so its number may be incomplete.
-  if (text == nullptr || !text->ends_with('\n')) return {};
-  int64_t microseconds = 0;
-  const char* end = text->data() + text->size() - 1;
-  const auto [stopped, error] = std::from_chars(text->data(), end, microseconds);
-  if (error != std::errc() || stopped != end || microseconds < 0) return {};
-  return Date(std::chrono::microseconds{microseconds});
+  const std::optional<int64_t> microseconds = recordedNumber(recordFile());
+  if (!microseconds) return {};
+  return Date(std::chrono::microseconds{*microseconds});
 }
 
 std::vector<PlatformError> StateDirectory::refusedFiles() const {
   std::vector<PlatformError> refused;
   const std::pair<std::string, size_t> kFiles[] = {{recordFile(), kMaxRecordSize},
+                                                   {putOffFile(), kMaxRecordSize},
                                                    {runRecordPath(path_), kMaxRunRecordBytes}};
   for (const auto& [path, maximum] : kFiles) {
     auto content = readOwnFile(path, maximum);
@@ -116,6 +125,16 @@ std::vector<PlatformError> StateDirectory::refusedFiles() const {
 
 std::optional<PlatformError> StateDirectory::recordRun(Date begin) const {
   return replaceFileDurably(recordFile(), std::to_string(begin.time_since_epoch().count()) + '\n');
+}
+
+std::chrono::seconds StateDirectory::putOff() const {
+  // The caller adds to it, in nanoseconds. A year leaves room for that.
+  constexpr int64_t kMost = 31'536'000;
+  return std::chrono::seconds{std::min(recordedNumber(putOffFile()).value_or(0), kMost)};
+}
+
+std::optional<PlatformError> StateDirectory::recordPutOff(std::chrono::seconds time) const {
+  return replaceFileDurably(putOffFile(), std::to_string(time.count()) + '\n');
 }
 
 namespace {

@@ -2,6 +2,7 @@
 
 #pragma once
 
+#include <chrono>
 #include <optional>
 #include <string>
 #include <utility>
@@ -28,6 +29,8 @@ class RunLock {
 //   scheduler-last-run  when the last run began that has ended and was not deferred: microseconds
 //                       since 1970, decimal, and a line feed. Only the holder of the lock writes
 //                       it.
+//   scheduler-put-off   for how many seconds the machine has put off the run that is due: decimal,
+//                       and a line feed
 //   defer               other programs make and remove it; while it exists, runs are deferred
 //
 // A file that the service reads here is a regular file of the directory's owner. Anything else
@@ -61,10 +64,16 @@ class StateDirectory {
   // stands after an error. REQUIRES: the caller holds the lock.
   std::optional<PlatformError> recordRun(Date begin) const;
 
+  // How long the machine has put off the run that is due. Zero if there is no record or it cannot
+  // be understood.
+  std::chrono::seconds putOff() const;
+  std::optional<PlatformError> recordPutOff(std::chrono::seconds time) const;
+
  private:
   explicit StateDirectory(std::string path) : path_(std::move(path)) {}
   std::optional<RunLock> lock(int operation) const;
   std::string recordFile() const { return path_ + "/scheduler-last-run"; }
+  std::string putOffFile() const { return path_ + "/scheduler-put-off"; }
 
   std::string path_;
 };

@@ -20,10 +20,9 @@ using testing::TemporaryDirectory;
 class DeferralConditionsTest : public ::testing::Test {
  protected:
   bool defers(DeferSources sources) const {
-    return DeferralConditions(sources, machine_.path("defer"), machine_.path("power"),
-                              machine_.path("cpu"))
-        .reason()
-        .has_value();
+    const DeferralConditions conditions(sources, machine_.path("defer"), machine_.path("power"),
+                                        machine_.path("cpu"));
+    return conditions.byFile() != DeferReason::none || conditions.byMachine() != DeferReason::none;
   }
   bool battery() const { return defers({false, true, false}); }
   bool pressure() const { return defers({false, false, true}); }
@@ -251,7 +250,19 @@ class ActivityDeliveriesTest : public StateDirectoryTest {
 
   FakeClock clock_;
   FakeServiceStatus status_;
-  DeferralConditions conditions_{{true, false, false}, state_.deferFile()};
+  void setPressure(const char* percent) {
+    temporary_.write("cpu", std::string("some avg10=") + percent + " avg60=0\n");
+  }
+  // As the service does: asks once, and then either defers or is in its run.
+  void deferOrRun(const std::function<void(Activity&)>& run) {
+    handle_ = [run](Activity& activity) {
+      const bool deferred = activity.shouldDefer() && activity.setState(kActivityStateDefer);
+      if (!deferred) run(activity);
+    };
+  }
+
+  DeferralConditions conditions_{
+      {true, false, true}, state_.deferFile(), temporary_.path("power"), temporary_.path("cpu")};
   std::function<void(Activity&)> handle_;
   std::vector<Date> begins_;
   std::vector<int64_t> states_;
@@ -315,6 +326,75 @@ TEST_F(ActivityDeliveriesTest, ADeferredRunIsOfferedAgain) {
   EXPECT_FALSE(once.deliverRun());
   EXPECT_THAT(begins_, ElementsAre(start, start + seconds{900}));
   EXPECT_EQ(state_.lastRun(), start + seconds{900});
+}
+
+// Two hours in all, however often the machine is switched off meanwhile.
+TEST_F(ActivityDeliveriesTest, TheMachinePutsARunOffForALimitedTime) {
+  const testing::RecordingLog log;
+  setPressure("99.00");
+  const Date start = clock_.now();
+  deferOrRun([&](Activity& activity) {
+    EXPECT_EQ(clock_.now() - start, hours{2} + seconds{3200}) << "one wait was not recorded";
+    EXPECT_FALSE(activity.shouldDefer()) << "the machine stops no run";
+  });
+  const ScheduleCriteria criteria{{}, seconds{4000}, hours{6}, hours{2}};
+  {
+    ActivityDeliveries first = deliveries(criteria);
+    EXPECT_TRUE(first.deliverRun());
+    EXPECT_EQ(log.lines(),
+              std::vector<std::string>{"The run is put off: the CPU is under pressure"});
+    EXPECT_THAT(status_.said, ElementsAre("run deferred: the CPU is under pressure"));
+    EXPECT_TRUE(first.deliverRun());
+    EXPECT_EQ(log.lines().size(), 1u) << "one line per run and reason";
+  }
+  EXPECT_EQ(state_.putOff(), seconds{4000}) << "the second wait ended with the process";
+  ActivityDeliveries second = deliveries(criteria);
+  EXPECT_TRUE(second.deliverRun());
+  EXPECT_FALSE(second.deliverRun());
+  EXPECT_EQ(state_.putOff(), seconds{0}) << "the next run has its own two hours";
+  EXPECT_TRUE(second.deliverRun());
+  temporary_.write("deep/state/scheduler-put-off", "7200\nnonsense");
+  EXPECT_EQ(state_.putOff(), seconds{0});
+}
+
+TEST_F(ActivityDeliveriesTest, TheDeferFileCountsForAsLongAsItStands) {
+  const testing::RecordingLog log;
+  wantDeferral();
+  deferOrRun([](Activity& activity) { EXPECT_TRUE(activity.shouldDefer()) << "under way"; });
+  ActivityDeliveries once = deliveries({});
+  for (int day = 0; day < 3 * 96; ++day) EXPECT_TRUE(once.deliverRun());
+  EXPECT_EQ(log.lines(),
+            std::vector<std::string>{"The run is put off: " + state_.deferFile() + " exists"});
+  wantNoDeferral();
+  handle_ = [&](Activity& activity) {
+    EXPECT_FALSE(activity.shouldDefer());
+    wantDeferral();
+    EXPECT_TRUE(activity.shouldDefer());
+    EXPECT_TRUE(activity.shouldDefer());
+  };
+  EXPECT_FALSE(once.deliverRun());
+  EXPECT_EQ(log.lines().back(), "The run is stopped early: " + state_.deferFile() + " exists");
+  EXPECT_EQ(log.lines().size(), 2u);
+}
+
+TEST_F(ActivityDeliveriesTest, ARunHasAnEnd) {
+  const testing::RecordingLog log;
+  deferOrRun([&](Activity& activity) {
+    clock_.advance(hours{6});
+    EXPECT_FALSE(activity.shouldDefer());
+    clock_.advance(seconds{1});
+    EXPECT_TRUE(activity.shouldDefer());
+    EXPECT_TRUE(activity.shouldDefer());
+  });
+  EXPECT_FALSE(deliveries({}).deliverRun()) << "it is not offered again";
+  EXPECT_THAT(log.lines(), ElementsAre("The run is stopped early: it has taken as long as "
+                                       "TESSEL_RUN_LIMIT allows"));
+  EXPECT_FALSE(latest_->shouldDefer()) << "the poll of a past run stops nothing";
+  deferOrRun([&](Activity& activity) {
+    clock_.advance(hours{24 * 365});
+    EXPECT_FALSE(activity.shouldDefer());
+  });
+  EXPECT_FALSE(deliveries({{}, seconds{900}, seconds{0}, hours{2}}).deliverRun());
 }
 
 TEST_F(ActivityDeliveriesTest, DeferIsTakenOnceDuringARun) {

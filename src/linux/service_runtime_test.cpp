@@ -49,6 +49,18 @@ TEST_F(ServiceManagerTest, ProgressFeedsFourTimesAPeriod) {
   EXPECT_EQ(messages_, std::vector<std::string>(4, "WATCHDOG=1"));
 }
 
+TEST_F(ServiceManagerTest, AWaitCountsAsProgressForAMinute) {
+  ServiceManager manager(clock_, remember(), std::chrono::seconds{8});
+  manager.progress();
+  for (int second = 1; second <= 200; ++second) {
+    clock_.advance(std::chrono::seconds{1});
+    manager.standInForProgress();
+  }
+  EXPECT_EQ(messages_.size(), 1u + 60 / 2);
+  manager.progress();
+  EXPECT_EQ(messages_.size(), 2u + 60 / 2);
+}
+
 class ServiceRuntimeTest : public ::testing::Test {
  protected:
   FakeClock clock_;

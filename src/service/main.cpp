@@ -151,8 +151,9 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
       keep<ReporterActivity>(runtime, makeRun(launch, state, clock, manager, reportingQueue));
   auto& conditions = keep<DeferralConditions>(launch.deferOn, state.deferFile());
   auto& scheduler =
-      keep<BackgroundScheduler>(ScheduleCriteria{launch.activityInterval, launch.deferRetry}, state,
-                                conditions, runtime, manager, clock);
+      keep<BackgroundScheduler>(ScheduleCriteria{launch.activityInterval, launch.deferRetry,
+                                                 launch.runLimit, launch.deferLimit},
+                                state, conditions, runtime, manager, clock);
   scheduler.registerActivity(kActivityName, [&activity](const std::shared_ptr<Activity>& changed) {
     activity.handleActivity(changed);
   });

@@ -13,10 +13,6 @@ namespace tessel {
 
 namespace {
 
-// The reader takes a few milliseconds for this many entries. The watchdog waits minutes, and one
-// call in 4,096 entries does not show in the time of a run.
-constexpr uint64_t kEntriesPerStep = 4096;
-
 // No entry is older than 1970, so an earlier date means the same as 1970.
 uint64_t microsecondsSince1970(Date date) {
   return static_cast<uint64_t>(std::max<Date::rep>(0, date.time_since_epoch().count()));
@@ -97,7 +93,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
     return true;
   }
   const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
-  auto opened = JournalStore::open(path ? path : systemStore_, range, table_, stop_);
+  auto opened = JournalStore::open(path ? path : systemStore_, range, table_, stop_, status_);
   if (auto* error = std::get_if<PlatformError>(&opened)) {
     errorOut = std::move(*error);
     return false;
@@ -113,7 +109,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
 // began, and the books balance wherever a stop ends it.
 void JournalExtractor::processEntries(EntryStream& entries) {
   while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
-    if (++report_.entriesRead % kEntriesPerStep == 0 && status_ != nullptr) status_->progress();
+    ++report_.entriesRead;
     const Entry entry = entries.entry();
     current_ = &entry.header;
     assembler_.consume(entry);

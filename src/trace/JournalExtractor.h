@@ -84,8 +84,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   // the machine's journal.
   explicit JournalExtractor(std::optional<std::string> systemStore = std::nullopt,
                             const ExtractionLimits& limits = {});
-  // Reports progress to `status` every few thousand entries. REQUIRES: `status` outlives the
-  // extractor.
+  // Reports the progress of reading to `status`. REQUIRES: `status` outlives the extractor.
   void reportProgressTo(ServiceStatus& status) { status_ = &status; }
 
   void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;

@@ -77,6 +77,15 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   return facts;
 }
 
+std::optional<std::string> deferralNow(const LaunchConfiguration& launch,
+                                       const StateDirectory& state) {
+  const DeferralConditions conditions(launch.deferOn, state.deferFile());
+  for (const DeferReason reason : {conditions.byFile(), conditions.byMachine()}) {
+    if (reason != DeferReason::none) return conditions.words(reason);
+  }
+  return {};
+}
+
 }  // namespace
 
 std::string_view markerOfName(MarkerOf kind) { return kind == MarkerOf::unit ? "unit" : "by_hand"; }
@@ -99,7 +108,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   status.now = now;
   status.tasking = askTasking(launch);
   status.taskingWords = taskingWords(status.tasking, launch);
-  status.deferral = DeferralConditions(launch.deferOn, state.deferFile()).reason();
+  status.deferral = deferralNow(launch, state);
   status.markers = lookForMarkers();
   status.run = readRunRecord(launch.stateDirectory);
   status.lastBegin = state.lastRun();
