@@ -70,8 +70,9 @@ class DeadServer(BundlesTest):
         self.mounted("Clock.c")
         exes = [EXE.format(os.path.join(self.machine.root, bundle)) for bundle in
                 ("dead/Clock.AppDir", "dead/a/b/Clock.AppDir", "links/Clock.AppDir", "links/Clock.a", "Clock.b", "Clock.c")]
-        self.machine.write_export([event(i, exes[i % len(exes)]) for i in range(50)] + [event(50, live)])
-        wanted = ["Clock"] * 50 + ["com.vantor.Clock"]
+        self.machine.write_export([event(i, exes[i % len(exes)]) for i in range(50)] +
+                                  [event(i, live) for i in range(50, 100)])
+        wanted = ["Clock"] * 50 + ["com.vantor.Clock"] * 50
         self.assertEqual(self.explained(), wanted)
         result = self.assert_clean(self.machine.result(self.machine.start(), 60))
         self.assertEqual(self.names(self.machine.rows()), wanted, result.errors)

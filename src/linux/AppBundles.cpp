@@ -14,10 +14,12 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <filesystem>
 #include <memory>
 #include <pugixml.hpp>
 #include <string_view>
+#include <system_error>
 #include <utility>
 #include <vector>
 
@@ -32,7 +34,7 @@ namespace {
 constexpr size_t kMaxMetadataSize = size_t{1} << 20;  // usual ones have a few kilobytes
 constexpr size_t kMaxIdentifierLength = 255;          // of a D-Bus name
 constexpr size_t kMaxDirectoryEntries = 10'000;       // a root with more is no application's
-// Links can make a walk as long as their owner likes. This many steps take some 50 ms.
+// Components of all paths of a look-up. Links can make them as many as their owner likes.
 constexpr size_t kMaxSteps = 10'000;
 constexpr int kMaxLinks = 40;  // of one path, as for the kernel; a link may lead to itself
 
@@ -107,14 +109,13 @@ std::optional<Place> Walk::root() {
   return place;
 }
 
-// The table is asked before the step, because a step onto some mounts already calls the server. A
-// mount that comes between the question and the step is found by its id. It was not touched then:
-// O_PATH opens nothing, and fstat() comes last.
+// The table is asked before the step, because a step onto some mounts already calls the server. Its
+// answer may be out of date: somebody mounts, or renames a directory above us. Then the id of the
+// mount tells, before anything calls the file system: O_PATH opens nothing, and fstat() comes last.
 std::optional<Place> Walk::step(const Place& at, const std::string& name) {
   Place next{{}, (at.path == "/" ? "" : at.path) + '/' + name};
   // A name with a zero byte would be another name for the kernel than for the table.
-  if (++steps_ > kMaxSteps || next.path.size() > PATH_MAX || name.find('\0') != std::string::npos)
-    return {};
+  if (next.path.size() > PATH_MAX || name.find('\0') != std::string::npos) return {};
   if (!mounts_.mayStepOnto(next.path)) return {};
   next.fd = UniqueFd(::openat(at.fd.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   if (!next.fd.valid() || !mounts_.isLocal(next.fd.get())) return {};
@@ -132,7 +133,7 @@ std::optional<std::string> linkTarget(const Place& link) {
 std::optional<Place> Walk::to(const Place& from, std::string path) {
   std::optional<Place> reached;  // absent while the walk stands at `from`
   int links = 0;
-  while (path.size() <= PATH_MAX) {
+  while (path.size() <= PATH_MAX && ++steps_ <= kMaxSteps) {
     const size_t begin = std::min(path.find_first_not_of('/'), path.size());
     const size_t end = std::min(path.find('/', begin), path.size());
     const std::string name = path.substr(begin, end - begin);
@@ -142,7 +143,7 @@ std::optional<Place> Walk::to(const Place& from, std::string path) {
     if (name == "..") {
       // The parent's path has no links, so we walk it anew. Going up by ".." could meet a mount.
       if (!reached && from.path == "/") continue;
-      if (!reached || ++steps_ > kMaxSteps) return {};
+      if (!reached) return {};
       const size_t parent = reached->path.rfind('/');
       path.insert(
           0, reached->path.substr(0, parent).erase(0, from.path == "/" ? 0 : from.path.size()));
@@ -185,8 +186,11 @@ OneFile oneFile(Walk& walk, const Place& bundle, const std::string& path, const 
   const int fd = ::openat(place.fd.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   const std::unique_ptr<DIR, CloseStream> directory(fd < 0 ? nullptr : ::fdopendir(fd));
   if (!directory) return one;
-  size_t seen = 0;
-  while (const dirent* entry = ::readdir(directory.get())) {
+  for (size_t seen = 0; !one.unclear;) {
+    errno = 0;
+    const dirent* entry = ::readdir(directory.get());
+    one.unclear = entry == nullptr && errno != 0;
+    if (!entry) break;
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
     if (++seen > kMaxDirectoryEntries) one.unclear = true;
@@ -198,7 +202,6 @@ OneFile oneFile(Walk& walk, const Place& bundle, const std::string& path, const 
       one.file = std::move(file);
       one.name = name;
     }
-    if (one.unclear) break;
   }
   one.unclear |= walk.exhausted();
   return one;
@@ -230,8 +233,9 @@ std::optional<std::string> componentId(const Place& file) {
 std::optional<std::string> AppBundles::bundleIdentifier(const std::string& directory) {
   Walk walk(mounts_);
   const auto root = walk.root();
-  const auto bundle =
-      root ? walk.to(*root, std::filesystem::absolute(directory).native()) : std::nullopt;
+  std::error_code error;  // of a working directory that was removed; the path is empty then
+  const auto path = std::filesystem::absolute(directory, error);
+  const auto bundle = root ? walk.to(*root, path.native()) : std::nullopt;
   if (!bundle) return {};
   constexpr const char* kMetadataPath = "usr/share/metainfo/";
   if (const auto metainfo = walk.to(*bundle, kMetadataPath)) {

@@ -119,9 +119,13 @@ TEST(AppBundlesTest, ALoneDesktopFileNamesTheBundle) {
 TEST(AppBundlesTest, ADirectoryWithTooManyEntriesHasNoIdentifier) {
   const TemporaryDirectory bundle;
   bundle.write("com.vantor.Clock.desktop", "");
-  for (int i = 1; i < 10'000; ++i) bundle.write(std::to_string(i), "");
+  bundle.write("1", "");
+  const auto add = [&](int number) {
+    std::filesystem::create_hard_link(bundle.path("1"), bundle.path(std::to_string(number)));
+  };
+  for (int i = 2; i < 10'000; ++i) add(i);
   EXPECT_EQ(identifierAt(bundle.path()), "com.vantor.Clock");
-  bundle.write("10000", "");
+  add(10'000);
   EXPECT_EQ(identifierAt(bundle.path()), std::nullopt);
 }
 
@@ -159,6 +163,21 @@ TEST(AppBundlesTest, OnlyRegularFilesOfTheTreeAreOpened) {
     std::filesystem::create_symlink(target, bundle + '/' + metadata);
     EXPECT_EQ(identifierAt(bundle), followed ? "com.vantor.Clock" : "com.vantor.Desktop") << target;
   }
+}
+
+// Each of the links has a long way that leads to no file.
+TEST(AppBundlesTest, LinksWithoutEndLeaveABundleUnclear) {
+  const TemporaryDirectory bundle;
+  bundle.write("com.vantor.Clock.desktop", "");
+  std::string way;
+  for (int i = 0; i < 2000; ++i) way += "./";
+  const auto link = [&](int number) {
+    std::filesystem::create_symlink(way, bundle.path(std::to_string(number) + ".desktop"));
+  };
+  for (int i = 0; i < 4; ++i) link(i);
+  EXPECT_EQ(identifierAt(bundle.path()), "com.vantor.Clock");
+  for (int i = 4; i < 6; ++i) link(i);
+  EXPECT_EQ(identifierAt(bundle.path()), std::nullopt);
 }
 
 TEST(AppBundlesTest, LinksOnTheWayToTheBundleAreFollowed) {
