@@ -3,6 +3,7 @@
 import ctypes
 import json
 import os
+import stat
 import subprocess
 import sys
 import time
@@ -104,13 +105,14 @@ while libc.renameat2({HERE}, one, {HERE}, other, {EXCHANGE}) == 0: pass
             checked(LIBC.inotify_add_watch(opened, path.encode(), IN_OPEN))
         for other in (pipe, link):
             with subprocess.Popen([sys.executable, "-c", self.SWAPPER, metadata, other]) as swapper:
-                seen = [name for _ in range(3) for name in self.explained()]
+                harness.wait_for(lambda: not stat.S_ISREG(os.lstat(metadata).st_mode))
+                seen = self.explained()
                 self.assertIsNone(swapper.poll(), "it swapped until now")
                 swapper.kill()
             self.assertEqual(set(seen), {"com.vantor.Clock", "Clock"}, "both were met")
             with self.assertRaises(BlockingIOError, msg="one was opened"):
                 os.read(opened, 4096)
-            if not os.path.isfile(metadata) or os.path.islink(metadata):
+            if not stat.S_ISREG(os.lstat(metadata).st_mode):
                 checked(LIBC.renameat2(HERE, metadata.encode(), HERE, other.encode(), EXCHANGE))
 
 
