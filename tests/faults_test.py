@@ -142,6 +142,7 @@ class Disk(FaultTest):
         self.assertEqual(machine.rows(), [])
         result = self.assert_clean(machine.run_faulty(PATH="tessel_reporter_running", AT=2, ERRNO=errno.EROFS))
         self.assertTrue(any(line.startswith("Could not clear cookie file") for line in result.log), result.log)
+        self.assertTrue(any(line.startswith("The run marker could not be removed") for line in result.warnings))
         self.assert_recovers(machine, marker=True)
 
     def test_a_disk_without_room_ends_in_counted_losses(self):

@@ -69,6 +69,7 @@ class Deferral(MachineTest):
         self.assertTrue(statistics["WasInterrupted"])
         self.assertLess(statistics["EventsReported"], 3000)
         self.assertTrue(any(line.endswith(" (Interrupted by deferral)") for line in result.log))
+        self.assertTrue(any(line.startswith("The run was cut short") for line in result.warnings), result.errors)
         self.assertFalse(self.machine.marker_exists())
 
 

@@ -2,10 +2,11 @@
 """What stands in the state directory, who may use it, and limits on files: none of them silences the service."""
 import json
 import os
+import sqlite3
 import subprocess
 
 import harness
-from harness import STATISTICS, MachineTest, in_namespace_argv, interrupt, point, some_points, wait_for
+from harness import STATISTICS, Entry, MachineTest, in_namespace_argv, interrupt, point, some_points, wait_for
 
 NOBODY = ("setpriv", "--reuid=65534", "--regid=65534", "--clear-groups")
 
@@ -80,6 +81,53 @@ class Limits(StateTest):
         self.assertEqual((record["marker"], self.machine.marker_exists()), ("removed", False))
         losses = {loss["code"]: loss["count"] for loss in record["reading"]["losses"]}
         self.assertEqual(losses["files_not_looked_at"] + record["reading"]["files_read"], 60)
+
+
+    def test_a_limit_on_file_size_costs_rows_and_no_run(self):
+        self.machine.write_export(some_points(60))
+        result = self.run_under("prlimit", "--fsize=65536")
+        self.assertEqual(result.returncode, 0, result.stderr)
+        record = self.record()
+        self.assertGreater(sum(record["rows_failed"].values()), 0)
+        self.assertEqual(record["rows_stored"] + sum(record["rows_failed"].values()), 122)
+        self.assertEqual((record["outcome"], record["marker"]), ("completed", "removed"))
+        result = self.run_under("prlimit", "--fsize=1")
+        self.assertEqual((result.returncode, self.machine.marker_exists()), (0, False), result.stderr)
+        self.assertIn("warning: The record of the run is not written: ", result.stderr)
+        self.assertEqual(self.record(), record)
+
+
+class Warnings(StateTest):
+    def warnings_of_a_run(self, **environment):
+        return self.run_clean(TESSEL_LOG_LEVEL="error", **environment).warnings
+
+    def test_each_reason_is_one_line_at_every_level(self):
+        malformed = [Entry([("TESSEL_KIND", "event"), ("TESSEL_SUBSYSTEM", f"\x1b[31m{i}\n")], exe=f"/w/{i}\n")
+                     for i in range(20)]
+        self.machine.write_export(some_points(2) + malformed)
+        self.assertEqual(len(self.warnings_of_a_run()), 1)
+        with open(os.path.join(self.machine.store, "b\n.journal"), "wb") as file:
+            file.write(bytes(1 << 16))
+        os.unlink(self.state("statora.db"))
+        with sqlite3.connect(self.state("statora.db")) as database:
+            database.execute("PRAGMA user_version = 99")
+        rows, files, points = self.warnings_of_a_run()
+        self.assertEqual(rows, "The spool refused rows of the run: 8 of 8, reason version")
+        self.assertRegex(files, r"^Files of the trace store were not read: 1; the first: .*/b\\x0a\.journal\)$")
+        self.assertRegex(points, r"^Trace points were malformed: 20; the first: [ -~]+$")
+
+    def test_a_run_that_does_not_report_says_why(self):
+        missing = os.path.join(self.machine.root, "nowhere")
+        line, = self.warnings_of_a_run(TESSEL_TRACE_STORE=missing)
+        self.assertTrue(line.startswith(f"The run failed: {missing}"), line)
+        open(os.path.join(self.machine.var_tmp, harness.MARKER), "wb").close()
+        line, = self.warnings_of_a_run()
+        self.assertTrue(line.startswith("The run read nothing, because an earlier run died"), line)
+        os.chmod(self.machine.var_tmp, 0o500)
+        self.machine.read_only.append("/var/tmp")
+        line, = self.warnings_of_a_run()
+        self.assertEqual(line, "The run failed: the run marker could not be made: /var/tmp/tessel_reporter_running: "
+                               "Read-only file system")
 
 
 class BuildVariant(StateTest):

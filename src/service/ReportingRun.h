@@ -42,8 +42,8 @@ class CookieFile {
   bool cookieFileExists();
   // Removes whatever is at the path. Logs an error if that fails.
   void clearCookieFile();
-  // True only if this call made the file. False if there was a marker already.
-  bool createCookieFile();
+  // Absent if this call made the file. It fails if there was a marker already.
+  std::optional<PlatformError> createCookieFile();
 
  private:
   FileManager& files_;

@@ -13,6 +13,7 @@
 #include "linux/LaunchConfiguration.h"
 #include "linux/LogSinks.h"
 #include "linux/RunRecordFile.h"
+#include "linux/RunWarnings.h"
 #include "linux/Scheduler.h"
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
@@ -84,6 +85,7 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
     if (const auto failure = writeRunRecord(record, stateDirectory)) {
       platformLog().warning("The record of the run is not written: %@", failure->words);
     }
+    logRunWarnings(record);
   }
   spool.beginRun();
 }

@@ -180,8 +180,9 @@ struct FakeConfigurationService final : ConfigurationService {
 
 struct FakeFiles final : FileManager {
   FileExistence existence(const std::string& path) override;
-  bool createFile(const std::string& path) override {
-    return canCreate && items.emplace(path, false).second;
+  std::optional<PlatformError> createFile(const std::string& path) override {
+    if (canCreate && items.emplace(path, false).second) return {};
+    return PlatformError{ErrorCode::failed, path + ": Disk full"};
   }
   RemovalResult remove(const std::string& path) override;
 

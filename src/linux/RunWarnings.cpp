@@ -1,0 +1,132 @@
+// The warnings of a run, in the order in which they weigh.
+//
+// Each text begins with words of its own. By these words linux/LogSinks.cpp finds the identifier
+// under which `journalctl -x` explains the line, so they must stand in both places.
+
+#include "linux/RunWarnings.h"
+
+#include <algorithm>
+#include <array>
+#include <numeric>
+
+#include "platform/Log.h"
+#include "platform/Text.h"
+
+namespace tessel {
+
+namespace {
+
+// A path of the journal takes some 100 bytes. With 256 for each foreign text a line stays below
+// 1 KiB, so the journal keeps it whole and a terminal shows it on a few rows.
+constexpr size_t kMaxTextBytes = 256;
+// A run knows fewer reasons and set-aside files. The bound matters for a record that was read from
+// a file.
+constexpr size_t kMaxOfAKind = 16;
+
+// Losses whose code is not here cost nobody a trace point: a point whose executable is unknown is
+// reported under another name.
+constexpr struct {
+  LossCode code;
+  std::string_view warning;  // codes with the same warning are summed up in one line
+  std::string_view beginning;
+} kLossWarnings[] = {
+    {LossCode::fileSkipped, "store_unreadable", "Files of the trace store were not read: "},
+    {LossCode::filesNotLookedAt, "store_unreadable", "Files of the trace store were not read: "},
+    {LossCode::fileDamaged, "store_damaged", "The trace store is damaged: "},
+    {LossCode::droppedByDaemon, "dropped_by_daemon", "The journal daemon dropped entries: "},
+    {LossCode::entriesMissing, "numbers_in_no_file", "Entries are in no file of the trace store: "},
+    {LossCode::malformed, "malformed", "Trace points were malformed: "},
+    {LossCode::openIntervalDropped, "over_share", "Writers had more than their share: "},
+    {LossCode::beyondPairLimit, "over_share", "Writers had more than their share: "},
+};
+
+std::string escaped(std::string_view text) { return shortPlainText(text, kMaxTextBytes); }
+
+std::string joined(const std::vector<std::string>& names) {
+  std::string list;
+  for (size_t at = 0; at < std::min(names.size(), kMaxOfAKind); ++at)
+    list += (at == 0 ? "" : ", ") + names[at];
+  return escaped(list);
+}
+
+void addOutcome(std::vector<RunWarning>& warnings, const RunRecord& record) {
+  if (record.outcome == RunOutcome::failed) {
+    warnings.push_back({"run_failed", "The run failed: " + escaped(record.failure)});
+  } else if (record.outcome == RunOutcome::bailedOut) {
+    warnings.push_back({"bailed_out",
+                        "The run read nothing, because an earlier run died: the run "
+                        "marker was there when it began"});
+  } else if (record.outcome == RunOutcome::interrupted) {
+    warnings.push_back({"run_cut_short",
+                        "The run was cut short: it was asked to stop before its "
+                        "day was read to the end"});
+  }
+  if (record.marker == "still there") {
+    warnings.push_back({"marker_stuck",
+                        "The run marker could not be removed: the next run will "
+                        "take this one for dead and read nothing"});
+  }
+}
+
+void addRows(std::vector<RunWarning>& warnings, const RunRecord& record) {
+  uint64_t refused = 0;
+  size_t reasons = 0;
+  for (const auto& [reason, rows] : record.rowsFailed) {
+    refused += rows;
+    if (rows == 0 || ++reasons > kMaxOfAKind) continue;
+    warnings.push_back({"rows_refused",
+                        "The spool refused rows of the run: " + std::to_string(rows) + " of " +
+                            std::to_string(record.rowsExpected()) + ", reason " + escaped(reason)});
+  }
+  if (record.hasBooks() && record.rowsStored + refused != record.rowsExpected()) {
+    warnings.push_back(
+        {"books_unbalanced",
+         "The books of the run do not balance: " + std::to_string(record.rowsStored) +
+             " rows stored and " + std::to_string(refused) + " refused, of " +
+             std::to_string(record.rowsExpected())});
+  }
+  if (!record.setAside.empty())
+    warnings.push_back(
+        {"spool_damaged", "A damaged spool was set aside: " + joined(record.setAside)});
+}
+
+std::string example(const Loss& loss) {
+  const std::string where = loss.where();
+  return escaped(loss.words) + (where.empty() ? "" : " (" + escaped(where) + ")");
+}
+
+void addLosses(std::vector<RunWarning>& warnings, const Losses& losses) {
+  uint64_t count = 0;
+  const Loss* first = nullptr;
+  for (size_t at = 0; at < std::size(kLossWarnings); ++at) {
+    const auto& row = kLossWarnings[at];
+    const auto listed = std::ranges::find(losses.all(), row.code, &Loss::code);
+    if (listed != losses.all().end()) {
+      count += losses.sum(row.code);
+      if (first == nullptr) first = &*listed;
+    }
+    const bool summed =
+        at + 1 < std::size(kLossWarnings) && kLossWarnings[at + 1].warning == row.warning;
+    if (summed || first == nullptr) continue;
+    warnings.push_back({row.warning, std::string(row.beginning) + std::to_string(count) +
+                                         "; the first: " + example(*first)});
+    count = 0;
+    first = nullptr;
+  }
+}
+
+}  // namespace
+
+std::vector<RunWarning> runWarnings(const RunRecord& record) {
+  std::vector<RunWarning> warnings;
+  addOutcome(warnings, record);
+  addRows(warnings, record);
+  if (record.reading) addLosses(warnings, record.reading->losses);
+  return warnings;
+}
+
+void logRunWarnings(const RunRecord& record) {
+  for (const RunWarning& warning : runWarnings(record)) platformLog().warning("%@", warning.text);
+}
+
+}  // namespace tessel

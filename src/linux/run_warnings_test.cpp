@@ -1,0 +1,89 @@
+// The warnings of a finished run.
+
+#include "linux/RunWarnings.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+
+#include "linux/LogSinks.h"
+#include "platform/Text.h"
+#include "platform/testing/Fakes.h"
+
+namespace tessel {
+namespace {
+
+std::vector<std::string> codesOf(const RunRecord& record) {
+  std::vector<std::string> codes;
+  for (const RunWarning& warning : runWarnings(record)) codes.emplace_back(warning.code);
+  return codes;
+}
+
+// Loses something for every reason, in texts from outside that are long and hostile.
+RunRecord worstRun() {
+  RunRecord record;
+  record.outcome = RunOutcome::interrupted;
+  record.marker = "still there";
+  for (int reason = 0; reason < 300; ++reason)
+    record.rowsFailed.emplace_back("reason\n" + std::to_string(reason) + std::string(4096, '\x1b'),
+                                   1);
+  record.setAside = std::vector<std::string>(300, std::string(4096, '\n'));
+  record.reading.emplace();
+  for (size_t code = 0; code < kLossCodes; ++code) {
+    for (int writer = 0; writer < 300; ++writer) {
+      record.reading->losses.add(static_cast<LossCode>(code), std::string(4096, '\x9b'),
+                                 {"/writer\n" + std::to_string(writer), writer});
+    }
+  }
+  return record;
+}
+
+TEST(RunWarningsTest, AGoodRunHasNone) {
+  RunRecord record;
+  record.rowsStored = record.rowsExpected();
+  record.marker = "removed";
+  record.rowsFailed = {{"locked", 0}};
+  record.reading.emplace().losses.add(LossCode::noImagePath, "process gone", {}, 7);
+  EXPECT_THAT(codesOf(record), ::testing::IsEmpty());
+}
+
+TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
+  RunRecord record = worstRun();
+  auto codes = codesOf(record);
+  EXPECT_EQ(std::ranges::count(codes, "rows_refused"), 16);
+  codes.erase(std::unique(codes.begin(), codes.end()), codes.end());
+  EXPECT_THAT(codes, ::testing::ElementsAre("run_cut_short", "marker_stuck", "rows_refused",
+                                            "books_unbalanced", "spool_damaged", "store_unreadable",
+                                            "store_damaged", "dropped_by_daemon",
+                                            "numbers_in_no_file", "malformed", "over_share"));
+  auto warnings = runWarnings(record);
+  for (const RunOutcome outcome : {RunOutcome::failed, RunOutcome::bailedOut}) {
+    record.outcome = outcome;
+    record.failure = std::string(4096, '\n');
+    warnings.push_back(runWarnings(record).front());
+  }
+  for (const auto& [code, text] : warnings) {
+    EXPECT_LT(text.size(), 1024u) << code;
+    EXPECT_EQ(text, plainText(text, "\\x0a")) << code;
+    EXPECT_THAT(journalFields(LogLevel::warning, "", "", text),
+                ::testing::Contains(::testing::StartsWith("MESSAGE_ID=")))
+        << text;
+  }
+}
+
+TEST(RunWarningsTest, LossesOfACodeAreSummedUp) {
+  RunRecord record;
+  record.rowsStored = record.rowsExpected();
+  Losses& losses = record.reading.emplace().losses;
+  losses.add(LossCode::fileSkipped, "Permission denied", {"/j/a.journal", {}}, 2);
+  losses.add(LossCode::fileSkipped, "Permission denied", {"/j/b.journal", {}});
+  losses.add(LossCode::filesNotLookedAt, "too many files to look at", {}, 4);
+  testing::RecordingLog log(LogLevel::error);
+  logRunWarnings(record);
+  EXPECT_THAT(log.lines(), ::testing::ElementsAre("Files of the trace store were not read: 7; the "
+                                                  "first: Permission denied (/j/a.journal)"));
+}
+
+}  // namespace
+}  // namespace tessel
