@@ -2,6 +2,7 @@
 """What stands in the state directory, who may use it, and limits on files: none of them silences the service."""
 import json
 import os
+import re
 import sqlite3
 import subprocess
 
@@ -32,18 +33,20 @@ class StateTest(MachineTest):
 class Names(StateTest):
     def test_a_pipe_under_any_name_hangs_nothing(self):
         self.machine.write_export(some_points(2))
-        names = ("last_run.json", "scheduler-last-run")
+        names = ("last_run.json", "scheduler-last-run", "scheduler-put-off")
         for name in names:
             os.mkfifo(self.state(name))
             os.mkfifo(self.state(name + ".new"))
         status = self.machine.result(self.machine.start("tesselctl", "status"), timeout=20)
         self.assertEqual(status.status, 0, status.errors)
+        self.assertEqual(re.sub(r"\s+", " ", status.out).count(": it is no regular file"), 3, status.out)
         result = self.assert_clean(self.machine.result(self.machine.start(), timeout=20))
         for name in names:
             refused = f"A file in the state directory is not used: {self.state(name)}: it is no regular file"
             self.assertEqual(result.warnings.count(refused), 1, result.errors)
         self.assertEqual(self.record()["outcome"], "completed")
-        self.assertEqual(self.assert_clean(self.machine.result(self.machine.start(), timeout=20)).warnings, [])
+        # Nothing was put off, so nothing was written under the last name.
+        self.assertEqual(self.assert_clean(self.machine.result(self.machine.start(), timeout=20)).warnings, [refused])
 
     def test_another_user_than_the_owner_is_refused(self):
         harness.require_root()
@@ -89,7 +92,7 @@ class Limits(StateTest):
         self.assertEqual(result.returncode, 0, result.stderr)
         record = self.record()
         self.assertGreater(sum(record["rows_failed"].values()), 0)
-        self.assertEqual(record["rows_stored"] + sum(record["rows_failed"].values()), 122)
+        self.assertEqual(record["rows_stored"] + sum(record["rows_failed"].values()), 2 * 60 + 4)
         self.assertEqual((record["outcome"], record["marker"]), ("completed", "removed"))
         result = self.run_under("prlimit", "--fsize=1")
         self.assertEqual((result.returncode, self.machine.marker_exists()), (0, False), result.stderr)

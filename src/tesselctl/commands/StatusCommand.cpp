@@ -176,6 +176,7 @@ class Screen {
       if (status_.hasBooks()) books(run);
       if (run.reading) store(*run.reading, run.logEvents);
     }
+    for (const PlatformError& refused : status_.refusedFiles) more(refused.words);
     // The scheduler notes the begin of a run once the run has ended. So a begin after the end of
     // the recorded run belongs to a later run, and that one left no record.
     if (status_.runWithoutRecord()) {

@@ -111,6 +111,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   status.deferral = deferralNow(launch, state);
   status.markers = lookForMarkers();
   status.run = readRunRecord(launch.stateDirectory);
+  status.refusedFiles = state.refusedFiles();
   status.lastBegin = state.lastRun();
   SpoolReader spool(launch.stateDirectory);
   status.spoolState = spool.open();

@@ -53,6 +53,7 @@ struct ReporterStatus {
   // The unit's first, if this machine has its directory; then that of a run by hand.
   std::vector<Marker> markers;
   std::optional<RunRecord> run;
+  std::vector<PlatformError> refusedFiles;  // of the state directory, each with the reason
   // The begin of the last run that came to its end and was not deferred. The scheduler notes it.
   std::optional<Date> lastBegin;
   SpoolReader::State spoolState = SpoolReader::State::absent;
