@@ -67,7 +67,6 @@ uint32_t nextNumber() {
 JournalReadResources& resources(uint32_t number) {
   static auto& kept = *new std::unique_ptr<JournalReadResources>;
   if (number == 0) kept = std::make_unique<JournalReadResources>();
-  kept->entryListsLeft = MarkedEntries::kMaxListsOfStore;
   return *kept;
 }
 
@@ -80,7 +79,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const auto* beginning = std::get_if<JournalBeginning>(&opened);
   if (beginning == nullptr) return 0;
   TracePointTable table({.fields = 64, .textBytes = size_t{64} << 10});
-  const std::vector<EntryMark> marks = table.marks();
+  const std::vector<std::string_view> marks = table.marks();
   StopFlag stop = false;
   FileReport report;
   const uint32_t number = nextNumber();

@@ -355,7 +355,7 @@ class Reading(ExplainTest):
 
     def test_what_the_store_lacks_is_told(self):
         self.machine.write_export([log_event("plain", at=-90), point("event", "a", "b", exe=None)])
-        self.machine.write_export([Entry([("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
+        self.machine.write_export([Entry([("_TRANSPORT", "driver"), ("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
                                           ("OBJECT_SYSTEMD_UNIT", "vantor.service")], at=-30)], "b.export",
                                   first_sequence=10)
         store = self.summary()["store"]

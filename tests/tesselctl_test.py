@@ -292,7 +292,7 @@ class Status(CtlTest):
         self.assertRegex(self.machine.ctl("status").out, r"Store +whole +1 file and 1 entry read\n\S")
 
         self.machine.write_export([log_event("plain", at=-90), point("event", "com.vantor.A", "x", "Two", exe=None)])
-        self.machine.write_export([Entry([("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
+        self.machine.write_export([Entry([("_TRANSPORT", "driver"), ("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7"),
                                           ("OBJECT_SYSTEMD_UNIT", "vantor.service")], at=-30)], "b.export",
                                   first_sequence=10)
         damaged, refused = (os.path.join(self.machine.store, name) for name in ("c.export", "\x1bd.journal"))

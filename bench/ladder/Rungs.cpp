@@ -19,7 +19,7 @@ namespace {
 // Wants what a trace point needs and looks at it no further.
 class Glance final : public FieldTokenizer {
  public:
-  std::vector<EntryMark> marks() const override { return TracePointTable().marks(); }
+  std::vector<std::string_view> marks() const override { return TracePointTable().marks(); }
   bool wants(std::string_view name) const override {
     return name.starts_with("TESSEL_") || name == "_EXE" || name == "_COMM" || name == "_PID";
   }

@@ -14,24 +14,31 @@ namespace tessel {
 
 namespace {
 
-// Compressed bytes that are read at once. The tokenizer sees only the first 4 KiB of a value, and
-// one read is nearly always enough for these.
-constexpr size_t kInputSize = size_t{16} << 10;
-// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD). The daemon did not
-// write a payload that asks for much more, and such a payload would only make us allocate. The log
-// of 22 stands for 4 MiB.
+// Compressed bytes that are read at once. One read is enough for nearly every value. LZ4 must have
+// all that it needs at once: as much as the text, and a little more if that compresses badly.
+constexpr size_t kUsualInput = size_t{16} << 10;
+constexpr size_t kInputSize = size_t{66} << 10;
+// The journal daemon compresses with windows of 1 MiB (XZ) and 2 MiB (ZSTD). Every decoder of ZSTD
+// should take windows of 8 MiB, whose log is 23. A payload that asks for more would only make us
+// allocate.
 constexpr uint64_t kXzMemoryLimit = uint64_t{8} << 20;
-constexpr int kZstdLargestWindowLog = 22;
+constexpr int kZstdLargestWindowLog = 23;
 
 }  // namespace
 
-// Making a context costs more than decompressing a value, so we keep it.
-struct Decompressor::ZstdContext {
-  ZSTD_DCtx* context = ZSTD_createDCtx();
-  ZstdContext() { ZSTD_DCtx_setParameter(context, ZSTD_d_windowLogMax, kZstdLargestWindowLog); }
-  ~ZstdContext() { ZSTD_freeDCtx(context); }
-  ZstdContext(const ZstdContext&) = delete;
-  ZstdContext& operator=(const ZstdContext&) = delete;
+// Making a context costs more than decompressing a value, so we keep both.
+struct Decompressor::Contexts {
+  ZSTD_DCtx* zstd = ZSTD_createDCtx();  // null: no memory
+  lzma_stream xz = LZMA_STREAM_INIT;
+  Contexts() {
+    if (zstd != nullptr) ZSTD_DCtx_setParameter(zstd, ZSTD_d_windowLogMax, kZstdLargestWindowLog);
+  }
+  ~Contexts() {
+    ZSTD_freeDCtx(zstd);
+    lzma_end(&xz);
+  }
+  Contexts(const Contexts&) = delete;
+  Contexts& operator=(const Contexts&) = delete;
 };
 
 Decompressor::Decompressor() : input_(kInputSize) {}
@@ -40,6 +47,9 @@ Decompressor::~Decompressor() = default;
 std::optional<Decompressor::Result> Decompressor::decompress(uint8_t compression,
                                                              const Source& source,
                                                              std::span<uint8_t> target) {
+  // Many stores never need the contexts: other compression, or no long value. So the first use
+  // makes them.
+  if (!contexts_) contexts_ = std::make_unique<Contexts>();
   switch (compression) {
     case journal_format::kXz:
       return decompressXz(source, target);
@@ -54,16 +64,17 @@ std::optional<Decompressor::Result> Decompressor::decompress(uint8_t compression
 
 std::optional<Decompressor::Result> Decompressor::decompressXz(const Source& source,
                                                                std::span<uint8_t> target) {
-  lzma_stream stream = LZMA_STREAM_INIT;
+  lzma_stream& stream = contexts_->xz;
+  // The last value was seldom read to its end. This begins anew and keeps the memory.
   if (lzma_stream_decoder(&stream, kXzMemoryLimit, 0) != LZMA_OK) return std::nullopt;
-  const std::unique_ptr<lzma_stream, void (*)(lzma_stream*)> ending(&stream, lzma_end);
+  stream.avail_in = 0;
   stream.next_out = target.data();
   stream.avail_out = target.size();
   uint64_t position = 0;
   for (lzma_ret state = LZMA_OK; state != LZMA_STREAM_END && stream.avail_out > 0;) {
     if (stream.avail_in == 0) {
       stream.next_in = input_.data();
-      stream.avail_in = source(position, input_);
+      stream.avail_in = source(position, std::span(input_).first(kUsualInput));
       position += stream.avail_in;
       if (stream.avail_in == 0) return std::nullopt;  // cut off: the stream has no end mark
     }
@@ -75,12 +86,13 @@ std::optional<Decompressor::Result> Decompressor::decompressXz(const Source& sou
 }
 
 // The payload begins with the size of the text in eight bytes; one block follows. A block is hardly
-// longer than its text, even if the text compresses badly. So input_ has room for all that the
-// first 4 KiB need, and one read is enough.
+// longer than its text, even if the text compresses badly. So one read of input_ holds all that
+// `target` needs.
 std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& source,
                                                                 std::span<uint8_t> target) {
   constexpr size_t kSizeBytes = 8;
-  const size_t got = source(0, input_);
+  const size_t needed = target.size() + target.size() / 128 + 64;
+  const size_t got = source(0, std::span(input_).first(std::min(needed, input_.size())));
   if (got <= kSizeBytes) return std::nullopt;
   const auto size = journal_format::load<uint64_t>(input_.data());
   const auto wanted = static_cast<int>(std::min<uint64_t>(size, target.size()));
@@ -96,22 +108,26 @@ std::optional<Decompressor::Result> Decompressor::decompressLz4(const Source& so
 
 std::optional<Decompressor::Result> Decompressor::decompressZstd(const Source& source,
                                                                  std::span<uint8_t> target) {
-  // Many stores never need the context: other compression, or no long value. So the first use makes
-  // it.
-  if (!zstd_) zstd_ = std::make_unique<ZstdContext>();
+  if (contexts_->zstd == nullptr) return std::nullopt;
   // The last value was seldom read to its end, so the context still stands in the middle of it.
-  ZSTD_DCtx_reset(zstd_->context, ZSTD_reset_session_only);
+  ZSTD_DCtx_reset(contexts_->zstd, ZSTD_reset_session_only);
   ZSTD_outBuffer output{target.data(), target.size(), 0};
-  ZSTD_inBuffer input{input_.data(), 0, 0};
-  uint64_t position = 0;
+  const std::span<uint8_t> piece = std::span(input_).first(kUsualInput);
+  ZSTD_inBuffer input{piece.data(), source(0, piece), 0};
+  // The decoder would also take frames that it has to skip, any number of them. The daemon writes
+  // none.
+  if (input.size < sizeof(uint32_t) ||
+      journal_format::load<uint32_t>(piece.data()) != ZSTD_MAGICNUMBER)
+    return std::nullopt;
+  uint64_t position = input.size;
   while (output.pos < output.size) {
     if (input.pos == input.size) {
-      input.size = source(position, input_);
+      input.size = source(position, piece);
       input.pos = 0;
       position += input.size;
       if (input.size == 0) return std::nullopt;
     }
-    const size_t left = ZSTD_decompressStream(zstd_->context, &output, &input);
+    const size_t left = ZSTD_decompressStream(contexts_->zstd, &output, &input);
     if (ZSTD_isError(left) != 0) return std::nullopt;
     // 0 says that the frame is complete; a payload is one frame.
     if (left == 0) return Result{output.pos, true};

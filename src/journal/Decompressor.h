@@ -37,14 +37,14 @@ class Decompressor {
                                    std::span<uint8_t> target);
 
  private:
-  struct ZstdContext;
+  struct Contexts;
 
   std::optional<Result> decompressXz(const Source& source, std::span<uint8_t> target);
   std::optional<Result> decompressLz4(const Source& source, std::span<uint8_t> target);
   std::optional<Result> decompressZstd(const Source& source, std::span<uint8_t> target);
 
   std::vector<uint8_t> input_;
-  std::unique_ptr<ZstdContext> zstd_;
+  std::unique_ptr<Contexts> contexts_;
 };
 
 }  // namespace tessel

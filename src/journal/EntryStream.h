@@ -46,22 +46,17 @@ inline constexpr size_t kMaxFieldValueLength = 4096;
 // Name, '=', value, and one more byte, which shows that a longer value was cut.
 inline constexpr size_t kMaxFieldHead = kMaxFieldNameLength + 1 + kMaxFieldValueLength + 1;
 
-// A field that makes an entry worth reading: the entry has a mark. Companions are further fields
-// that do so. They nearly always stand in the same entries as the field, so a reader that has
-// compared their counts follows the field alone.
-struct EntryMark {
-  std::string_view field;
-  std::string_view value = {};  // only this value counts; empty: any value does
-  std::vector<std::string_view> companions = {};
-};
+// Bytes. A reader looks at no more of each FIELD=value to find the entries that are needed.
+inline constexpr size_t kMaxMark = 64;
 
 // Turns distinct FIELD=value texts into tokens.
 class FieldTokenizer {
  public:
   virtual ~FieldTokenizer() = default;
-  // The marks of the entries that the user needs; empty: it needs every entry. A reader that knows
-  // from the file's index which entries have a mark may deliver the others without tokens.
-  virtual std::vector<EntryMark> marks() const { return {}; }
+  // The user needs only entries that have a FIELD=value which begins with one of these texts;
+  // empty: it needs every entry. A reader may deliver the other entries without tokens. A text is
+  // at most kMaxMark bytes long.
+  virtual std::vector<std::string_view> marks() const { return {}; }
   // Whether a field of this name can ever have a token. Asked before a value is decompressed.
   virtual bool wants(std::string_view fieldName) const = 0;
   // The token of one FIELD=value; kNoToken if the field is not wanted. `value` is the whole value,

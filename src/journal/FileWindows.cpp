@@ -32,8 +32,12 @@ WindowedFile::WindowedFile(UniqueFd fd, uint64_t size, WindowBudget& budget)
 
 WindowedFile::~WindowedFile() { budget_.leave(); }
 
-const uint8_t* WindowedFile::at(uint64_t offset, size_t size, uint64_t from) {
-  if (const uint8_t* bytes = inWindow(offset, size)) return bytes;
+bool WindowedFile::removed() const {
+  struct stat status {};
+  return ::fstat(fd_.get(), &status) == 0 && status.st_nlink == 0;
+}
+
+const uint8_t* WindowedFile::atElsewhere(uint64_t offset, size_t size, uint64_t from) {
   if (offset > size_ || size > size_ - offset) return nullptr;
   // The share bounds the memory of a run. moveWindow() below takes more only if the caller asked
   // for more bytes at once.

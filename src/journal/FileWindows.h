@@ -66,6 +66,8 @@ class WindowedFile {
   uint64_t size() const { return size_; }
   // Bytes that the window may take.
   size_t share() const { return budget_.share(); }
+  // Whether the file has no name any more. It can be read whole until its blocks are freed.
+  bool removed() const;
   // Whether a read failed or found the file shorter than it was. Stays true.
   bool failed() const { return failed_; }
 
@@ -73,7 +75,11 @@ class WindowedFile {
   // in the window, the window moves. A caller that will also look at bytes before them passes the
   // offset of these as `from`: the window then begins there if all fit. Valid until the next call
   // of at().
-  const uint8_t* at(uint64_t offset, size_t size, uint64_t from);
+  const uint8_t* at(uint64_t offset, size_t size, uint64_t from) {
+    if (const uint8_t* bytes = inWindow(offset, size)) [[likely]]
+      return bytes;
+    return atElsewhere(offset, size, from);
+  }
   const uint8_t* at(uint64_t offset, size_t size) { return at(offset, size, offset); }
   // Returns the same without moving the window, or null if the bytes are not in it.
   const uint8_t* inWindow(uint64_t offset, size_t size) const {
@@ -81,6 +87,8 @@ class WindowedFile {
     const size_t skipped = static_cast<size_t>(offset - windowStart_);
     return size <= windowLength_ - skipped ? window_.get() + skipped : nullptr;
   }
+  // Drops what is in the window, so that bytes which others wrote meanwhile are read.
+  void forget() { windowLength_ = 0; }
   // Bytes of the window from `offset` on; empty if `offset` is not in the window.
   std::span<const uint8_t> restOfWindow(uint64_t offset) const;
   // The first offset, `offset` or later, that is not in a hole of the file, rounded down to eight
@@ -90,6 +98,7 @@ class WindowedFile {
   size_t read(uint64_t offset, std::span<uint8_t> target);
 
  private:
+  const uint8_t* atElsewhere(uint64_t offset, size_t size, uint64_t from);
   void moveWindow(uint64_t start, size_t wanted);
 
   UniqueFd fd_;

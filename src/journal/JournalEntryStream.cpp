@@ -1,20 +1,38 @@
-// Three parts: where the next entry is, what is wrong with the file, and the tokens of an entry.
+// Whether an entry is wanted, the tokens of one that is, and what is wrong with the file.
 
 #include "journal/JournalEntryStream.h"
 
 #include <algorithm>
-#include <string_view>
 #include <utility>
 
-#include "platform/Invariant.h"
+#include "journal/JournalHash.h"
 
 namespace tessel {
 
 using namespace journal_format;
 
 namespace {
+
 // Returned instead of a token if a data object holds no FIELD=value. No token has this value.
 constexpr FieldToken kDamaged = UINT32_MAX;
+
+// Bytes. Most data objects are shorter than this. A value that is not in the window is read with
+// two calls if it is longer, and otherwise the kernel copies less.
+constexpr size_t kUsualText = 440;
+
+// Nanoseconds that it takes to decompress a value, and each byte of it before and after.
+constexpr uint64_t kXzValue = 10'000;
+constexpr uint64_t kXzByte = 20;
+constexpr uint64_t kOtherValue = 1000;
+// A file whose every value is compressed stays below 100 ns for each byte of the file. A small one
+// is allowed as much as one of half a megabyte.
+constexpr uint64_t kAllowedPerByte = 200;
+constexpr uint64_t kAllowedBytes = 500'000;
+
+std::string_view textOf(std::span<const uint8_t> bytes) {
+  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+
 }  // namespace
 
 JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header,
@@ -22,142 +40,144 @@ JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const Journal
     : file_(std::move(fd), size, header, context.resources.windows),
       number_(number),
       context_(context),
-      chain_(file_, header.entryArray, header.entryCount),
-      marked_(
-          MarkedEntries::of(file_, context.marks, context.resources.entryListsLeft, context.stop)),
-      searchedTo_(header.headerSize),
-      firstFresh_(header.headerSize) {
-  entry_.sequenceId = header.sequenceId;
-}
+      walk_(file_, context.report, context.stop),
+      places_(context.resources.placesLeft) {}
 
 bool JournalEntryStream::next() {
-  while (!context_.stop.load(std::memory_order_relaxed)) {
-    const uint64_t offset = search_ || pending_ != 0 ? nextFound() : nextListed();
-    if (offset == 0) {
-      // After a stop the rest of the file is not missing, only unread.
-      if (!context_.stop.load(std::memory_order_relaxed)) finish();
-      return false;
-    }
-    if (take(offset)) return true;
+  if (walk_.next()) {
+    checkTime();
+    return true;
   }
+  // After a stop the rest of the file is not missing, only unread.
+  if (!stopped()) finish();
   return false;
 }
 
-// The offset of the next entry that the chain lists. If the chain has a gap before that entry, the
-// stream searches the gap first.
-uint64_t JournalEntryStream::nextListed() {
-  if (finished_) return 0;
-  const uint64_t offset = chain_.next();
-  finished_ = offset == 0;
-  if (!chain_.gapBefore()) [[likely]]
-    return offset;
-  searchUpTo(offset);
-  return nextFound();
-}
-
-// The offset of the next entry while the stream searches a gap. First come the entries that the
-// search finds, then the listed entry behind the gap, then the further entries of the chain.
-uint64_t JournalEntryStream::nextFound() {
-  if (search_) {
-    if (const auto found = search_->next()) return *found;
-    endSearch();
+// No hash covers the times and the boot of an entry, and a wrong time moves it out of the range. In
+// one boot the difference of the two clocks changes only when the clock is set, and then all later
+// entries have the new one. So an entry that differs from its neighbours is damaged, if these
+// agree.
+void JournalEntryStream::checkTime() {
+  constexpr uint64_t kMinute = 60'000'000;  // the clock may drift, and is set in small steps often
+  const EntryHeader& entry = walk_.header();
+  const uint64_t difference = entry.realtime - entry.monotonic;
+  const bool usual =
+      difference - usualDifference_ + kMinute <= 2 * kMinute && sameId(entry.bootId, usualBoot_);
+  if (usual && unusualEntry_ == 0) [[likely]]
+    return;
+  if (usual) context_.report.addProblem("entry with wrong times", unusualEntry_);
+  if (!usual && (unusualEntry_ != 0 || walk_.entriesFound() == 1)) {
+    usualBoot_ = entry.bootId;
+    usualDifference_ = difference;
+  } else if (!usual) {
+    unusualEntry_ = walk_.offset();
+    return;
   }
-  if (pending_ != 0) return std::exchange(pending_, 0);
-  return nextListed();
-}
-
-// Makes the entry at `offset` the current one; false if no valid entry is there. Then its offset or
-// its size may be wrong, and other entries may stand in its place. So the stream searches up to the
-// next listed entry.
-bool JournalEntryStream::take(uint64_t offset) {
-  const uint64_t size = file_.readEntry(offset, searchedTo_, entry_);
-  if (size == 0) {
-    context_.report.addProblem("entry damaged", offset);
-    const uint64_t next = chain_.next();
-    finished_ = next == 0;
-    searchUpTo(next);
-    return false;
-  }
-  TESSEL_INVARIANT(offset > entryOffset_);  // so no entry is delivered twice
-  entryOffset_ = offset;
-  entrySize_ = size;
-  firstFresh_ = searchedTo_;
-  searchedTo_ = alignUp(offset + size);
-  ++delivered_;
-  // We read the lists when we opened the file. An entry beyond the count was added later, so it may
-  // have a mark and still be in no list.
-  entryMarked_ = marked_ == nullptr || delivered_ > file_.header().entryCount || isMarked(offset);
-  return true;
-}
-
-bool JournalEntryStream::isMarked(uint64_t offset) {
-  if (!marked_->has(offset)) [[likely]]
-    return false;
-  // Without the lists we look into every further entry, so damage costs time, not entries.
-  if (marked_->missed()) context_.report.addProblem("list of entries damaged", offset);
-  if (!marked_->usable()) marked_.reset();
-  return true;
-}
-
-// Starts to search the part before `listed`, the next entry of the chain; 0: up to the end.
-void JournalEntryStream::searchUpTo(uint64_t listed) {
-  if (chain_.gapBefore()) context_.report.addProblem("entry array damaged", chain_.problemAt());
-  // The search may find entries that are in no list, and may pass over listed ones, which would
-  // look as if the lists were wrong. So we look into every entry from here on.
-  marked_.reset();
-  pending_ = listed;
-  const uint64_t end = listed == 0 ? file_.objectsEnd() : listed;
-  search_.emplace(file_, std::min(searchedTo_, end), end, context_.stop);
-}
-
-void JournalEntryStream::endSearch() {
-  if (search_->damagedPlaces() != 0)
-    context_.report.addProblem("objects damaged", search_->firstDamage(), search_->damagedPlaces());
-  search_.reset();
-  searchedTo_ = std::max(searchedTo_, pending_);
+  unusualEntry_ = 0;
 }
 
 // Reports once what the file should have held. next() may be called again after the end.
 void JournalEntryStream::finish() {
-  if (std::exchange(reported_, true)) return;
-  const uint64_t expected = file_.header().entryCount;
-  // We asked about no entry beyond the count, so then a list may rightly wait for one.
-  if (marked_ && marked_->awaitsMore() && delivered_ <= expected)
-    context_.report.addProblem("list of entries damaged", file_.objectsEnd());
+  if (std::exchange(finished_, true)) return;
+  Losses& problems = context_.report.problems;
+  const uint64_t counted = file_.header().entryCount;
+  const uint64_t missing = counted - std::min(counted, walk_.entriesFound());
+  // When the daemon removes a file it also frees its blocks, and those that we have not read are
+  // zeros from then on. Whatever looks damaged then is not.
+  if ((missing != 0 || !problems.empty()) && file_.file().removed()) {
+    problems = {};
+    problems.add(LossCode::entriesMissing, "the file was removed while it was read", {},
+                 std::max<uint64_t>(missing, 1));
+    return;
+  }
   // When the daemon closes a file it cuts off the end that it has not used. Nothing is lost then,
   // so a failed read alone is no problem.
-  if (file_.file().failed() && (expected > delivered_ || !context_.report.problems.empty()))
+  if (file_.file().failed() && (missing != 0 || !problems.empty()))
     context_.report.addProblem("cut short or not readable", file_.file().size());
-  if (expected > delivered_)
-    context_.report.addProblem("entries missing", file_.objectsEnd(), expected - delivered_);
+  context_.report.addProblem("entries missing", file_.objectsEnd(), missing);
+  // The last entry has no later neighbour. The header of a closed file has its times instead.
+  if (!file_.header().beingWritten() && walk_.entriesFound() != 0 &&
+      (walk_.header().realtime != file_.header().tailRealtime ||
+       walk_.header().monotonic != file_.header().tailMonotonic))
+    context_.report.addProblem("last entry with other times than the header", walk_.offset());
 }
 
 Entry JournalEntryStream::entry() {
-  if (!entryMarked_) return {entry_, {}};
-  const size_t count = collectTokens();
-  return {entry_, std::span(context_.resources.tokens).first(count)};
+  const size_t count =
+      file_.header().compact() ? collectTokens<uint32_t>() : collectTokens<uint64_t>();
+  return {walk_.header(), std::span(context_.resources.tokens).first(count)};
 }
 
 // Returns how many tokens the entry has.
+template <typename Item>
 size_t JournalEntryStream::collectTokens() {
-  const size_t all = file_.itemCount(entrySize_);
+  const size_t all = file_.itemCount(walk_.size());
   const size_t count = std::min(all, JournalFile::kMaxItems);
-  if (all > count) context_.report.addProblem("entry with too many fields", entryOffset_);
-  const uint64_t offset = entryOffset_ + kEntryItemsAt;
-  // If the window moves, it begins at firstFresh_, so that it also holds the data objects that were
-  // written for this entry.
-  const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), firstFresh_);
+  const uint64_t offset = walk_.offset() + kEntryItemsAt;
+  // If the window moves, it begins at firstFresh(), so that it also holds the data objects that
+  // were written for this entry.
+  const uint8_t* items = file_.file().at(offset, count * file_.itemSize(), walk_.firstFresh());
   if (items == nullptr) {
-    context_.report.addProblem("entry damaged", entryOffset_);
+    context_.report.addProblem("entry damaged", walk_.offset());
     return 0;
   }
-  return file_.header().compact() ? tokensOf<uint32_t>(items, count)
-                                  : tokensOf<uint64_t>(items, count);
+  comparable_ = all == count;
+  if (!comparable_) context_.report.addProblem("entry with too many fields", walk_.offset());
+  if (!context_.marks.empty() && !hasMark<Item>(items, count)) return 0;
+  return tokensOf<Item>(items, count);
 }
 
-// This is the innermost loop of the service, with some 20 rounds for each entry. It is a template,
-// so that it need not ask for the layout in each round. It writes each token and then moves on only
-// if the token is wanted: that spares a branch which the processor cannot predict.
+// This and tokensOf() are the innermost loops of the service, with some 20 rounds for each entry.
+// They are templates, so that they need not ask for the layout in each round.
+template <typename Item>
+bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
+  constexpr size_t kStep =
+      sizeof(Item) == sizeof(uint32_t) ? kCompactEntryItemSize : kEntryItemSize;
+  MarkPlaces::View places(places_);
+  for (const uint8_t *item = items, *end = items + count * kStep; item != end; item += kStep) {
+    const uint64_t offset = load<Item>(item);
+    MarkPlaces::State state = places.at(offset);
+    if (state == MarkPlaces::plain) [[likely]]
+      continue;
+    if (state == MarkPlaces::unknown) {
+      state = look(offset);
+      places = MarkPlaces::View(places_);
+    }
+    if (state == MarkPlaces::mark) return true;
+  }
+  return false;
+}
+
+// Looks at a data object for the first time. One that cannot be read counts as a mark: its entry is
+// then read, and the damage told.
+MarkPlaces::State JournalEntryStream::look(uint64_t offset) {
+  // Nearly always the object stands in the window, before its first entry.
+  const auto head = file_.headInWindow(offset, kMaxMark);
+  const MarkPlaces::State state = head.empty() ? lookFarther(offset) : stateOf(head);
+  // Without memory for the answer we would look at the object again for each entry that has it. The
+  // tokens of these entries are in the cache, so to collect them costs less.
+  return places_.set(offset, state) ? state : MarkPlaces::mark;
+}
+
+MarkPlaces::State JournalEntryStream::lookFarther(uint64_t offset) {
+  DataObject data;
+  if (!file_.readData(offset, kMaxMark, context_.resources.data, data)) return MarkPlaces::mark;
+  if (data.compression == 0) return stateOf(data.head);
+  const std::span<uint8_t> text = std::span(context_.resources.text).first(kMaxMark);
+  const auto result = decompress(data, text);
+  if (!result || result->produced == 0) return MarkPlaces::mark;
+  return stateOf(text.first(result->produced));
+}
+
+MarkPlaces::State JournalEntryStream::stateOf(std::span<const uint8_t> head) const {
+  const std::string_view text = textOf(head);
+  for (const std::string_view mark : context_.marks)
+    if (text.front() == mark.front() && text.starts_with(mark)) return MarkPlaces::mark;
+  return MarkPlaces::plain;
+}
+
+// The loop writes each token and then moves on only if the token is wanted: that spares a branch
+// which the processor cannot predict.
 template <typename Item>
 size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
@@ -165,72 +185,116 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   const size_t step = file_.itemSize();
   FieldToken* const tokens = context_.resources.tokens.data();
   FieldToken* kept = tokens;
+  uint32_t hash = 0;
   for (size_t i = 0; i < count; ++i) {
     const uint64_t offset = load<Item>(items + i * step);
-    FieldToken token = offset <= TokenCache::kMaxOffset ? cache.find(offset) : TokenCache::kUnknown;
-    if (token == TokenCache::kUnknown) [[unlikely]] {
+    TokenCache::Value value{TokenCache::kUnknown, 0};
+    if (TokenCache::takes(offset)) [[likely]]
+      value = cache.find(offset);
+    if (value.token == TokenCache::kUnknown) [[unlikely]] {
       // We look at the flag here and not for each field: only a miss reads and decompresses, which
       // can take long.
-      if (context_.stop.load(std::memory_order_relaxed)) break;
-      token = newTokenAt(offset);
+      if (stopped()) return static_cast<size_t>(kept - tokens);
+      value = newTokenAt(offset);
     }
-    *kept = token;
-    kept += token != kNoToken;
+    *kept = value.token;
+    kept += value.token != kNoToken;
+    hash ^= value.hash;
   }
+  // Half of the hash is enough: one damaged entry in four billion passes.
+  if (hash != static_cast<uint32_t>(walk_.header().contentHash) && comparable_) [[unlikely]]
+    return intactTokensOf<Item>(items, count);
   return static_cast<size_t>(kept - tokens);
 }
 
-// Reads a data object and shows it to the tokenizer. The cache does not remember every token. It
-// must not remember an invalid object, because that may overlap a valid one and have the same key.
-// It need not remember a value that was written for this entry and says that no other has it:
-// nobody will ask for it again, and it would push out a value that recurs. It does remember every
-// compressed value: if the value's claim is wrong, decompressing it again and again would be slow.
-FieldToken JournalEntryStream::newTokenAt(uint64_t offset) {
-  DataObject data;
-  if (!file_.readData(offset, context_.resources.data, data)) {
-    context_.report.addProblem("data object damaged", offset);
-    return kNoToken;
+// The tokens of an entry that does not match its hash, without those of damaged data objects.
+template <typename Item>
+size_t JournalEntryStream::intactTokensOf(const uint8_t* items, size_t count) {
+  const size_t step = file_.itemSize();
+  FieldToken* const tokens = context_.resources.tokens.data();
+  size_t kept = 0;
+  bool damaged = false;
+  for (size_t i = 0; i < count && !stopped(); ++i) {
+    const uint64_t offset = load<Item>(items + i * step);
+    DataObject data;
+    const auto text = textAt(offset, data);
+    if (!text || !file_.hashOfData(text->head, data.hash)) {
+      context_.report.addProblem("data object damaged", offset);
+      damaged = true;
+      continue;
+    }
+    const FieldToken token = tokenOf(*text);
+    if (token != kNoToken && token != kDamaged) tokens[kept++] = token;
   }
-  FieldToken token =
-      data.compression == 0 ? textToken(data.head, data.payloadSize) : decompressToken(data);
+  if (damaged || stopped()) return kept;
+  context_.report.addProblem("entry damaged", walk_.offset());
+  return 0;
+}
+
+// Reads a data object and shows it to the tokenizer. The cache does not remember every token. It
+// need not remember a value that was written for this entry and says that no other has it: nobody
+// will ask for it again, and it would push out a value that recurs. It does remember every
+// compressed value: if the value's claim is wrong, decompressing it again and again would be slow.
+TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
+  DataObject data;
+  const auto text = textAt(offset, data);
+  const FieldToken token = text ? tokenOf(*text) : kDamaged;
   if (token == kDamaged) {
     context_.report.addProblem("data object damaged", offset);
-    token = kNoToken;
+    comparable_ = false;
+    return {};
   }
-  if (offset < firstFresh_ || data.entryCount != 1 || data.compression != 0)
-    TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, token);
-  return token;
+  comparable_ = comparable_ && text->whole;
+  const TokenCache::Value value{token, static_cast<uint32_t>(lookup3(text->head))};
+  // The hash of a part is no hash, so such a value must be met anew each time.
+  if (text->whole && (offset < walk_.firstFresh() || data.entryCount != 1 || data.compression != 0))
+    TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, value);
+  return value;
 }
 
-FieldToken JournalEntryStream::textToken(std::span<const uint8_t> head, uint64_t size) {
-  const std::string_view text(reinterpret_cast<const char*>(head.data()), head.size());
-  const size_t nameLength = text.substr(0, kMaxFieldNameLength + 1).find('=');
+// The text of the data object at `offset`, whole if it is not too long to be hashed.
+std::optional<JournalEntryStream::Text> JournalEntryStream::textAt(uint64_t offset,
+                                                                   DataObject& data) {
+  JournalReadResources& resources = context_.resources;
+  if (!file_.readData(offset, kUsualText, resources.data, data)) return std::nullopt;
+  if (data.compression != 0) {
+    const auto result = decompress(data, resources.text);
+    if (!result || result->produced == 0) return std::nullopt;
+    const auto head = std::span<const uint8_t>(resources.text).first(result->produced);
+    return Text{head, head.size() + !result->complete, result->complete};
+  }
+  if (!data.isWhole() &&
+      !file_.readData(offset, JournalReadResources::kLongestHashed, resources.data, data))
+    return std::nullopt;
+  return Text{data.head, data.payloadSize, data.isWhole()};
+}
+
+FieldToken JournalEntryStream::tokenOf(const Text& text) {
+  const std::string_view head = textOf(text.head).substr(0, kMaxFieldHead);
+  const size_t nameLength = head.substr(0, kMaxFieldNameLength + 1).find('=');
   if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
-  return context_.tokenizer.tokenFor(text.substr(0, nameLength), text.substr(nameLength + 1),
-                                     size - nameLength - 1);
+  return context_.tokenizer.tokenFor(head.substr(0, nameLength), head.substr(nameLength + 1),
+                                     text.size - nameLength - 1);
 }
 
-// Decompresses the name first, and the value only if the name is wanted. Most compressed values are
-// long messages, which no tokenizer of the service wants.
-FieldToken JournalEntryStream::decompressToken(const DataObject& data) {
-  const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> target) {
+// A file that was made to cost time can let thousands of data objects share the same bytes, each of
+// which takes long to decompress. So what the decompressing costs is estimated, and beyond the
+// allowance of the file all further compressed values count as damaged.
+std::optional<Decompressor::Result> JournalEntryStream::decompress(const DataObject& data,
+                                                                   std::span<uint8_t> target) {
+  if (decompressing_ / kAllowedPerByte > kAllowedBytes + file_.file().size()) return std::nullopt;
+  uint64_t bytes = 0;
+  const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> input) {
     const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);
-    const auto length = static_cast<size_t>(std::min<uint64_t>(left, target.size()));
-    return file_.file().read(data.payloadOffset + position, target.first(length));
+    const auto length = static_cast<size_t>(std::min<uint64_t>(left, input.size()));
+    const size_t got = file_.file().read(data.payloadOffset + position, input.first(length));
+    bytes += got;
+    return stopped() ? 0 : got;
   };
-  Decompressor& decompressor = context_.resources.decompressor;
-  const std::span<uint8_t> text = context_.resources.text;
-  const auto name =
-      decompressor.decompress(data.compression, source, text.first(kMaxFieldNameLength + 1));
-  if (!name) return kDamaged;
-  const std::string_view start(reinterpret_cast<const char*>(text.data()), name->produced);
-  const size_t nameLength = start.find('=');
-  if (nameLength == std::string_view::npos || nameLength == 0) return kDamaged;
-  if (!context_.tokenizer.wants(start.substr(0, nameLength))) return kNoToken;
-  const auto whole = decompressor.decompress(data.compression, source, text);
-  if (!whole) return kDamaged;
-  return textToken(text.first(whole->produced),
-                   whole->complete ? whole->produced : text.size() + 1);
+  const auto result = context_.resources.decompressor.decompress(data.compression, source, target);
+  bytes += result ? result->produced : target.size();
+  decompressing_ += data.compression == kXz ? kXzValue + kXzByte * bytes : kOtherValue + bytes;
+  return result;
 }
 
 }  // namespace tessel

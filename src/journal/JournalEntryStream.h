@@ -1,26 +1,33 @@
 // JournalEntryStream: the entries of one journal file, in the file's own order.
 //
-// The stream follows the chain of entry arrays from entry to entry, and its window moves forward
-// over the file. A writer puts a new data object directly before the first entry that refers to it,
-// so the window usually holds both. The stream has read older data objects before, and the token
-// cache remembers most of them.
+// EntryWalk finds the entries, and the window moves forward over the file. A writer puts a new data
+// object directly before the first entry that refers to it, so the window usually holds both. The
+// stream has read older data objects before, and the token cache remembers most of them.
 //
-// If the chain or an entry is damaged, the stream searches the part up to the next listed entry
-// object by object. The offsets of delivered entries only grow, so no entry is delivered twice,
-// even if the search finds it and the chain lists it too.
+// Few entries of a day have a mark (see FieldTokenizer::marks()), and to make tokens of all fields
+// of all entries would be most of the work. So we first ask of each field only whether it is a
+// mark. MarkPlaces answers that for every data object that was looked at before. Nothing but the
+// entry itself and the data objects that it names has a say, so no wrong word elsewhere can hide an
+// entry. A trace point has several marks, so one wrong word in the entry cannot hide it either.
+//
+// Each entry that has a mark is compared with its own hash, which covers the texts of all its
+// fields. If they differ, a text or the list of fields is not what the daemon wrote. The hashes of
+// the data objects tell which: a field with a wrong text is left out; if all texts are right, the
+// entry names wrong ones and all its fields are left out. Entries without a mark are not compared,
+// because reading every text would cost more than all else.
 //
 // Threads: one at a time, except for the stop flag.
 
 #pragma once
 
 #include <array>
-#include <memory>
 #include <optional>
+#include <string_view>
+#include <vector>
 
 #include "journal/Decompressor.h"
-#include "journal/EntryIndex.h"
-#include "journal/EntrySearch.h"
 #include "journal/EntryStream.h"
+#include "journal/EntryWalk.h"
 #include "journal/JournalFile.h"
 #include "journal/StoreReport.h"
 #include "journal/TokenCache.h"
@@ -30,13 +37,17 @@ namespace tessel {
 // What the readers of all files of a store share, so that memory does not grow with their number.
 // Only one of them collects the tokens of an entry at a time, so one set of buffers is enough.
 struct JournalReadResources {
+  // Bytes. An entry with a longer text is not compared with its hash. Nearly all texts of trace
+  // points have less than 100 bytes.
+  static constexpr size_t kLongestHashed = size_t{64} << 10;
+
   WindowBudget windows;
   TokenCache tokenCache;
   Decompressor decompressor;
-  std::array<uint8_t, JournalFile::kMaxDataRead> data;
-  std::array<uint8_t, kMaxFieldHead> text;
+  std::array<uint8_t, JournalFile::kMaxDataHeader + kLongestHashed> data;
+  std::array<uint8_t, kLongestHashed> text;
   std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the current entry
-  size_t entryListsLeft = MarkedEntries::kMaxListsOfStore;
+  size_t placesLeft = MarkPlaces::kTotal;
 };
 
 class JournalEntryStream final : public EntryStream {
@@ -45,7 +56,7 @@ class JournalEntryStream final : public EntryStream {
   struct Context {
     JournalReadResources& resources;
     FieldTokenizer& tokenizer;
-    std::span<const EntryMark> marks;  // the tokenizer's, made once for all files
+    std::span<const std::string_view> marks;  // the tokenizer's, made once for all files
     const StopFlag& stop;
     FileReport& report;
   };
@@ -56,40 +67,47 @@ class JournalEntryStream final : public EntryStream {
                      const Context& context);
 
   bool next() override;
-  const EntryHeader& header() const override { return entry_; }
+  const EntryHeader& header() const override { return walk_.header(); }
   Entry entry() override;
 
  private:
-  uint64_t nextListed();
-  uint64_t nextFound();
-  bool take(uint64_t offset);
-  bool isMarked(uint64_t offset);
-  void searchUpTo(uint64_t listed);
-  void endSearch();
+  struct Text {
+    std::span<const uint8_t> head;
+    uint64_t size = 0;   // of the whole text, or any greater number than that of `head`
+    bool whole = false;  // `head` is the whole text
+  };
+
+  void checkTime();
   void finish();
+  bool stopped() const { return context_.stop.load(std::memory_order_relaxed); }
+  template <typename Item>
   size_t collectTokens();
   template <typename Item>
+  bool hasMark(const uint8_t* items, size_t count);
+  MarkPlaces::State look(uint64_t offset);
+  MarkPlaces::State lookFarther(uint64_t offset);
+  MarkPlaces::State stateOf(std::span<const uint8_t> head) const;
+  template <typename Item>
   size_t tokensOf(const uint8_t* items, size_t count);
-  FieldToken newTokenAt(uint64_t offset);
-  FieldToken decompressToken(const DataObject& data);
-  FieldToken textToken(std::span<const uint8_t> head, uint64_t size);
+  template <typename Item>
+  size_t intactTokensOf(const uint8_t* items, size_t count);
+  TokenCache::Value newTokenAt(uint64_t offset);
+  std::optional<Text> textAt(uint64_t offset, DataObject& data);
+  FieldToken tokenOf(const Text& text);
+  std::optional<Decompressor::Result> decompress(const DataObject& data, std::span<uint8_t> target);
 
   JournalFile file_;
   const uint32_t number_;
   Context context_;
-  EntryChain chain_;
-  std::unique_ptr<MarkedEntries> marked_;  // null: we look into every entry
-  std::optional<EntrySearch> search_;
-  uint64_t pending_ = 0;   // the listed entry that follows the searched part; 0: none
-  bool finished_ = false;  // the chain has ended
-  bool reported_ = false;  // finish() was done
-  uint64_t delivered_ = 0;
-  uint64_t searchedTo_ = 0;  // entries before this offset were delivered or are lost
-  uint64_t firstFresh_ = 0;  // data objects from here on were written for the current entry
-  EntryHeader entry_;
-  uint64_t entryOffset_ = 0;
-  uint64_t entrySize_ = 0;
-  bool entryMarked_ = true;  // false: entry() leaves out the tokens
+  EntryWalk walk_;
+  MarkPlaces places_;
+  // Boot and difference of the two clocks, as the entries before had them.
+  Id128 usualBoot_{};
+  uint64_t usualDifference_ = 0;
+  uint64_t unusualEntry_ = 0;   // offset of the last entry, if it differed from that; 0: it did not
+  uint64_t decompressing_ = 0;  // nanoseconds, estimated
+  bool finished_ = false;
+  bool comparable_ = true;  // the current entry can be compared with its hash
 };
 
 }  // namespace tessel

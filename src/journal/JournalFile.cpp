@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "journal/JournalHash.h"
 #include "os/Files.h"
 
 namespace tessel {
@@ -18,42 +19,10 @@ using namespace journal_format;
 
 namespace {
 
-// The smallest size of a valid object. A writer makes no object that holds nothing, so an empty one
-// is damage.
-uint64_t leastSize(uint8_t type, size_t dataHeaderSize) {
-  switch (type) {
-    case kData:
-      return dataHeaderSize + 1;
-    case kField:
-      return kFieldHeaderSize + 1;
-    case kEntry:
-      return kEntryItemsAt + kCompactEntryItemSize;
-    case kEntryArray:
-      return kArrayItemsAt + kCompactEntryItemSize;
-    case kTag:
-      return kTagSize;
-    default:
-      return kObjectHeaderSize + 1;
-  }
-}
-
 Id128 loadId(const uint8_t* at) {
   Id128 id;
   std::memcpy(id.data(), at, id.size());
   return id;
-}
-
-// Where the objects end. Usually that is the end of the arena; but if the arena still grows, or
-// says that it is larger than the file, it is the end of the file. If the size of the header itself
-// is damaged, we assume the shortest header, and the search finds the first object behind it.
-uint64_t endOfObjects(JournalHeader& header, uint64_t arenaSize, uint64_t fileSize) {
-  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
-      header.headerSize > std::min(fileSize, kMaxHeaderSize)) {
-    header.headerSize = kMinHeaderSize;
-    return fileSize;
-  }
-  if (header.beingWritten() || arenaSize > fileSize - header.headerSize) return fileSize;
-  return header.headerSize + arenaSize;
 }
 
 }  // namespace
@@ -67,34 +36,32 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   JournalHeader header;
   header.incompatibleFlags = load<uint32_t>(at + kIncompatibleFlagsAt);
   header.state = at[kStateAt];
+  header.fileId = loadId(at + kFileIdAt);
   header.sequenceId = loadId(at + kSequenceIdAt);
   header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
-  header.objectsEnd = endOfObjects(header, load<uint64_t>(at + kArenaSizeAt), fileSize);
-  // A closed file has no unfinished objects. If the offset is damaged, we do not use it: otherwise
-  // it would hide intact objects.
-  const auto lastObject = load<uint64_t>(at + kTailObjectAt);
-  const bool growing = header.beingWritten() && aligned(lastObject) &&
-                       lastObject >= header.headerSize && lastObject < header.objectsEnd;
-  header.lastObject = growing ? lastObject : UINT64_MAX;
+  // With the shortest header, the reader finds the first object by itself.
+  if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
+      header.headerSize > std::min(fileSize, kMaxHeaderSize))
+    header.headerSize = kMinHeaderSize;
+  // A damaged offset must not hide the objects behind it.
+  header.lastObject = load<uint64_t>(at + kTailObjectAt);
+  if (!aligned(header.lastObject) || header.lastObject < header.headerSize ||
+      header.lastObject >= fileSize)
+    header.lastObject = UINT64_MAX;
   // We report as missing the entries that are counted but not found. So a damaged count must not be
   // greater than the file's room for entries.
   header.entryCount = std::min(load<uint64_t>(at + kEntryCountAt), fileSize / kEntryItemsAt);
   header.entryArray = load<uint64_t>(at + kEntryArrayAt);
   header.headRealtime = load<uint64_t>(at + kHeadRealtimeAt);
   header.tailRealtime = load<uint64_t>(at + kTailRealtimeAt);
-  // Old headers lack these values. They then stay 0, and the index is not used.
-  if (bytes.size() >= kHeaderRead && header.headerSize >= kHeaderRead) {
-    header.fieldTable = load<uint64_t>(at + kFieldTableAt);
-    header.fieldTableSize = load<uint64_t>(at + kFieldTableSizeAt);
-    header.fieldCount = load<uint64_t>(at + kFieldCountAt);
-  }
+  header.tailMonotonic = load<uint64_t>(at + kTailMonotonicAt);
   return header;
 }
 
 // The daemon may append between the two calls. We ask for the size last, so that it covers
 // everything that the header counts.
 std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd) {
-  std::array<uint8_t, kHeaderRead> bytes;
+  std::array<uint8_t, kMinHeaderSize> bytes;
   const ssize_t got = ::pread(fd, bytes.data(), bytes.size(), 0);
   struct stat status {};
   if (got < 0 || ::fstat(fd, &status) != 0) return PlatformError{codeOf(errno), errorWords(errno)};
@@ -113,28 +80,12 @@ JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header
       itemShift_(std::countr_zero(header.compact() ? kCompactEntryItemSize : kEntryItemSize)),
       dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
 
-std::optional<ObjectHeader> JournalFile::objectHeader(std::span<const uint8_t> bytes,
-                                                      uint64_t room) const {
-  const uint64_t first = load<uint64_t>(bytes.data());
-  ObjectHeader object{static_cast<uint8_t>(first & 0xff), static_cast<uint8_t>(first >> 8 & 0xff),
-                      load<uint64_t>(bytes.data() + kObjectSizeAt)};
-  // The six bytes behind type and flags are zero, and only data objects have flags. These checks
-  // keep most garbage from being taken for an object.
-  if (first >> 16 != 0 || object.type == kUnused || object.type > kTag) return std::nullopt;
-  if (object.flags != 0 && (object.type != kData || (object.flags & ~kKnownDataFlags) != 0))
-    return std::nullopt;
-  if (object.size < leastSize(object.type, dataHeaderSize_) || object.size > room)
-    return std::nullopt;
-  return object;
-}
-
 uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
   if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
   // Computed first: at() may find the file cut before `offset`, and objectsEnd() then moves.
   const uint64_t room = objectsEnd() - offset;
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
-  // The first word is the type alone: an entry has no flags, and the reserved bytes are zero.
-  if (at == nullptr || load<uint64_t>(at) != kEntry) return 0;
+  if (at == nullptr || *at != kEntry) return 0;
   const auto size = load<uint64_t>(at + kObjectSizeAt);
   if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
   entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
@@ -150,30 +101,33 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
   return size;
 }
 
-bool JournalFile::readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch,
+bool JournalFile::readData(uint64_t offset, size_t most, std::span<uint8_t> scratch,
                            DataObject& data) {
   if (!mayHoldObject(offset, dataHeaderSize_ + 1)) return false;
   const uint64_t room = objectsEnd() - offset;
-  const uint64_t wanted = std::min(room, dataHeaderSize_ + kMaxFieldHead);
+  const uint64_t wanted = std::min<uint64_t>(room, dataHeaderSize_ + most);
   std::span<const uint8_t> bytes = file_.restOfWindow(offset);
   // The window may end within the object. Its size is then unknown or too large for the window.
   if (bytes.size() < wanted && (bytes.size() < kObjectHeaderSize ||
                                 bytes.size() < load<uint64_t>(bytes.data() + kObjectSizeAt))) {
-    bytes = {scratch.data(), file_.read(offset, {scratch.data(), static_cast<size_t>(wanted)})};
+    bytes = {scratch.data(), file_.read(offset, scratch.first(static_cast<size_t>(wanted)))};
   }
   if (bytes.size() <= dataHeaderSize_) return false;
-  const auto first = load<uint64_t>(bytes.data());
-  data.compression = static_cast<uint8_t>(first >> 8);
-  // The first word: type, flags, and six bytes that are zero.
-  if ((first & ~(uint64_t{kKnownDataFlags} << 8)) != kData) return false;
+  data.compression = bytes[1];
+  if (bytes[0] != kData || (data.compression & ~kKnownDataFlags) != 0) return false;
   const auto size = load<uint64_t>(bytes.data() + kObjectSizeAt);
   const uint64_t shown = std::min(size, wanted);
   if (size <= dataHeaderSize_ || size > room || shown > bytes.size()) return false;
+  data.hash = load<uint64_t>(bytes.data() + kDataHashAt);
   data.entryCount = load<uint64_t>(bytes.data() + kDataEntryCountAt);
   data.payloadOffset = offset + dataHeaderSize_;
   data.payloadSize = size - dataHeaderSize_;
   data.head = bytes.first(static_cast<size_t>(shown)).subspan(dataHeaderSize_);
   return true;
+}
+
+bool JournalFile::hashOfData(std::span<const uint8_t> text, uint64_t hash) const {
+  return hash == (header_.keyedHash() ? sipHash24(text, header_.fileId) : lookup3(text));
 }
 
 }  // namespace tessel

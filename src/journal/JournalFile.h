@@ -6,8 +6,8 @@
 // numbers against those that a writer can produce. An object that fails a check counts as absent,
 // and the caller decides what follows.
 //
-// We do not check hashes: for that we would have to read every payload whole. Damage that keeps all
-// links and sizes right can therefore change a text.
+// Hashes are checked by JournalEntryStream, and only for entries whose fields it reads: for the
+// others we would have to read every payload whole.
 //
 // Threads: one at a time.
 
@@ -31,25 +31,24 @@ namespace tessel {
 struct JournalHeader {
   uint32_t incompatibleFlags = 0;
   uint8_t state = 0;
+  Id128 fileId{};
   Id128 sequenceId{};
   uint64_t headerSize = 0;  // bytes; the objects begin there
-  uint64_t objectsEnd = 0;  // the objects end there, at most at the end of the file
   // How many entries the header counts; at most as many as the file has room for.
   uint64_t entryCount = 0;
   uint64_t entryArray = 0;  // offset of the first entry array; 0: none
-  // Objects behind this offset may be unfinished. UINT64_MAX: the file is closed and all are
-  // finished, or the header's offset is damaged.
+  // Offset of the object that was appended last. In a file that is being written, objects behind it
+  // may be unfinished. UINT64_MAX: the header's offset is damaged.
   uint64_t lastObject = 0;
   uint64_t headRealtime = 0;  // of the first and last entry written; 0: unknown
   uint64_t tailRealtime = 0;
-  uint64_t fieldTable = 0;      // offset of the buckets of the hash table of fields; 0: unknown
-  uint64_t fieldTableSize = 0;  // bytes
-  uint64_t fieldCount = 0;      // of distinct names
+  uint64_t tailMonotonic = 0;
 
   bool compact() const { return (incompatibleFlags & journal_format::kCompact) != 0; }
   uint32_t unknownFlags() const {
     return incompatibleFlags & ~journal_format::kKnownIncompatibleFlags;
   }
+  bool keyedHash() const { return (incompatibleFlags & journal_format::kKeyedHash) != 0; }
   bool beingWritten() const { return state == journal_format::kOnline; }
 };
 
@@ -68,16 +67,18 @@ std::variant<JournalBeginning, PlatformError> readJournalHeader(int fd);
 
 struct ObjectHeader {
   uint8_t type = 0;
-  uint8_t flags = 0;
-  uint64_t size = 0;  // without the padding to the next object
+  uint64_t size = 0;  // without the padding to the next object; 0: there is no valid object
 };
 
 struct DataObject {
   uint8_t compression = 0;  // a journal_format::DataFlag; 0: none
+  uint64_t hash = 0;        // of its text, as the file says
   uint64_t entryCount = 0;  // how many entries it says refer to it
   uint64_t payloadOffset = 0;
   uint64_t payloadSize = 0;       // in the file, at least 1
   std::span<const uint8_t> head;  // the beginning of the payload, in the window or in `scratch`
+
+  bool isWhole() const { return head.size() == payloadSize; }
 };
 
 class JournalFile {
@@ -91,16 +92,27 @@ class JournalFile {
   const JournalHeader& header() const { return header_; }
   WindowedFile& file() { return file_; }
 
-  // The end of the objects. It becomes smaller if a read finds the file shorter.
-  uint64_t objectsEnd() const { return std::min(header_.objectsEnd, file_.size()); }
+  // The end of the objects: that of the file, because a wrong size in the header could hide some.
+  // It becomes smaller if a read finds the file shorter.
+  uint64_t objectsEnd() const { return file_.size(); }
   // Whether an object of `least` bytes may begin at `offset`.
   bool mayHoldObject(uint64_t offset, uint64_t least) const {
     return journal_format::aligned(offset) && offset >= header_.headerSize &&
            offset < objectsEnd() && least <= objectsEnd() - offset;
   }
-  // The header of the object at the beginning of `bytes`; nothing if the format does not allow it
-  // or if it is longer than `room` bytes. REQUIRES: bytes.size() >= kObjectHeaderSize.
-  std::optional<ObjectHeader> objectHeader(std::span<const uint8_t> bytes, uint64_t room) const;
+  // The header of the object that begins with the kObjectHeaderSize bytes at `at`. It is not valid
+  // if the format does not allow it or if the object is longer than `room` bytes.
+  static ObjectHeader objectHeader(const uint8_t* at, uint64_t room) {
+    using namespace journal_format;
+    const uint8_t type = at[0];
+    const uint8_t flags = at[1];
+    const auto size = load<uint64_t>(at + kObjectSizeAt);
+    // The six bytes behind type and flags are zero today. We ignore them: a later daemon may use
+    // them, and a wrong one must not cost the object. Only data objects have flags.
+    const bool valid = type <= kTag && size >= kLeastSizes[type] && size <= room &&
+                       (flags & ~(type == kData ? kKnownDataFlags : 0)) == 0;
+    return {type, valid ? size : 0};
+  }
 
   // Fills `entry` from the entry object at `offset`, except for its sequence id, which is that of
   // the file. If the window moves, it begins at `from` if possible. Returns the size of the object
@@ -112,16 +124,39 @@ class JournalFile {
   }
   size_t itemSize() const { return size_t{1} << itemShift_; }
   // Bytes of a data object before its payload.
-  size_t dataHeaderSize() const { return dataHeaderSize_; }
-  // The most bytes of a data object that are read: its header and the head of its payload.
-  static constexpr size_t kMaxDataRead = journal_format::kCompactDataHeaderSize + kMaxFieldHead;
+  static constexpr size_t kMaxDataHeader = journal_format::kCompactDataHeaderSize;
 
-  // Fills `data` from the data object at `offset`, with up to kMaxFieldHead bytes of its payload;
+  // Fills `data` from the data object at `offset`, with the first `most` bytes of its payload;
   // false if there is no valid one. The window does not move: an old value far away must not push
-  // out the entries that come next. What is not in the window is read into `scratch`.
-  bool readData(uint64_t offset, std::span<uint8_t, kMaxDataRead> scratch, DataObject& data);
+  // out the entries that come next. What is not in the window is read into `scratch`, which has
+  // room for `most` and kMaxDataHeader bytes.
+  bool readData(uint64_t offset, size_t most, std::span<uint8_t> scratch, DataObject& data);
+  // The beginning of the payload, up to `most` bytes, of a data object that is not compressed and
+  // stands in the window; empty otherwise. The quick way to what nearly always is there.
+  std::span<const uint8_t> headInWindow(uint64_t offset, size_t most) const {
+    using namespace journal_format;
+    const uint8_t* at = file_.inWindow(offset, dataHeaderSize_ + most);
+    if (at == nullptr || load<uint16_t>(at) != kData || !aligned(offset)) return {};
+    const auto size = load<uint64_t>(at + kObjectSizeAt);
+    if (size <= dataHeaderSize_ || size > objectsEnd() - offset) return {};
+    return {at + dataHeaderSize_,
+            static_cast<size_t>(std::min<uint64_t>(size - dataHeaderSize_, most))};
+  }
+  // Whether the hash of a data object with this text is `hash`.
+  bool hashOfData(std::span<const uint8_t> text, uint64_t hash) const;
 
  private:
+  // By type, the smallest size of a valid object. A writer makes no object that holds nothing, so
+  // an empty one is damage.
+  static constexpr uint64_t kLeastSizes[] = {UINT64_MAX,  // kUnused
+                                             journal_format::kDataHeaderSize + 1,
+                                             journal_format::kFieldHeaderSize + 1,
+                                             journal_format::kEntryItemsAt + 4,
+                                             journal_format::kObjectHeaderSize + 1,
+                                             journal_format::kObjectHeaderSize + 1,
+                                             journal_format::kArrayItemsAt + 4,
+                                             journal_format::kTagSize};
+
   const JournalHeader header_;
   WindowedFile file_;
   const int itemShift_;  // the size of an item is a power of two; division is slow

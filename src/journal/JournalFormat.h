@@ -6,20 +6,17 @@
 // are little-endian; all links are offsets from the beginning of the file, and 0 means "none".
 //
 //   header --kEntryArrayAt--> entry array --kArrayNextAt--> entry array --> ... --> 0
-//      |                        | | |        (each about twice as long as the one before)
-//      |                        v v v
-//      |                      entry: number, times, boot, and a list of data objects
-//      |                                              |
-//      |                                              v
-//      |                      data: one FIELD=value, stored once, compressed or not
-//      |                        ^   |--kDataFirstEntryAt--> the first entry that has this value
-//      |                        |   |--kDataEntryArrayAt--> entry arrays with the others
-//      |                        |   '--kNextValueAt-------> an older value of the same field
-//      '--kFieldTableAt--> field: one name --kFieldFirstValueAt (the newest value)
+//                               | | |        (each about twice as long as the one before)
+//                               v v v
+//                             entry: number, times, boot, and a list of data objects
+//                                                     |
+//                                                     v
+//                             data: one FIELD=value, stored once, compressed or not
 //
-// The hash table of fields is a row of buckets. A bucket holds the offset of its first field, and
-// kNextInBucketAt leads from there to the others. There is such a table for data too; we do not
-// need it, because we never look up a value that we have not seen.
+// A writer puts a data object before the first entry that has it. There are more links: hash tables
+// of data and of fields, the values of a field, the entries that have a value. We follow none of
+// them. They would lead to the entries that have a certain value without a look at the others. But
+// each is one more way in which a wrong word can hide entries, and the look costs little.
 //
 // Files with the flag kCompact have 32-bit offsets in entries and entry arrays, and a longer data
 // header.
@@ -34,10 +31,8 @@ namespace tessel::journal_format {
 
 inline constexpr char kSignature[9] = "LPKSHHRH";
 
-// The shortest header that was ever written. Newer writers append values, which we may ignore.
+// The shortest header that was ever written. It holds all that we use; newer writers append more.
 inline constexpr uint64_t kMinHeaderSize = 208;
-// We read a longer header up to here: kFieldCountAt is the last value that we use.
-inline constexpr uint64_t kHeaderRead = 224;
 // Writers use less than 300 bytes. A header that claims more than a page is damaged.
 inline constexpr uint64_t kMaxHeaderSize = 4096;
 
@@ -45,7 +40,7 @@ inline constexpr uint64_t kMaxHeaderSize = 4096;
 enum IncompatibleFlag : uint32_t {
   kCompressedXz = 1,
   kCompressedLz4 = 2,
-  kKeyedHash = 4,  // changes the order of the hash tables; we do not rely on it
+  kKeyedHash = 4,  // of data objects: see JournalHash.h
   kCompressedZstd = 8,
   kCompact = 16,
 };
@@ -58,17 +53,15 @@ enum FileState : uint8_t { kOffline = 0, kOnline = 1, kArchived = 2 };
 // Offsets in the header.
 inline constexpr size_t kIncompatibleFlagsAt = 12;
 inline constexpr size_t kStateAt = 16;
+inline constexpr size_t kFileIdAt = 24;
 inline constexpr size_t kSequenceIdAt = 72;
 inline constexpr size_t kHeaderSizeAt = 88;
-inline constexpr size_t kArenaSizeAt = 96;
-inline constexpr size_t kFieldTableAt = 120;  // of the first bucket, not of the table's object
-inline constexpr size_t kFieldTableSizeAt = 128;
 inline constexpr size_t kTailObjectAt = 136;  // the object that was appended last
 inline constexpr size_t kEntryCountAt = 152;
 inline constexpr size_t kEntryArrayAt = 176;
 inline constexpr size_t kHeadRealtimeAt = 184;  // of the first entry that was written
 inline constexpr size_t kTailRealtimeAt = 192;  // of the last one
-inline constexpr size_t kFieldCountAt = 216;
+inline constexpr size_t kTailMonotonicAt = 200;
 
 enum ObjectType : uint8_t {
   kUnused = 0,
@@ -89,17 +82,11 @@ inline constexpr uint8_t kKnownDataFlags = kXz | kLz4 | kZstd;
 inline constexpr size_t kObjectHeaderSize = 16;
 inline constexpr size_t kObjectSizeAt = 8;
 
-inline constexpr size_t kBucketSize = 16;  // the offsets of the bucket's first and last object
-inline constexpr size_t kNextInBucketAt = 24;
-
-inline constexpr size_t kNextValueAt = 32;
-inline constexpr size_t kDataFirstEntryAt = 40;
-inline constexpr size_t kDataEntryArrayAt = 48;
+inline constexpr size_t kDataHashAt = 16;
 inline constexpr size_t kDataEntryCountAt = 56;  // all entries, the first one included
 inline constexpr size_t kDataHeaderSize = 64;
 inline constexpr size_t kCompactDataHeaderSize = 72;
 
-inline constexpr size_t kFieldFirstValueAt = 32;
 inline constexpr size_t kFieldHeaderSize = 40;
 inline constexpr size_t kTagSize = 64;
 

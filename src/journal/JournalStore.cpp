@@ -135,7 +135,7 @@ struct JournalStore::State final : EntryStream {
   JournalReadResources resources;
   ExportReadResources exports{resources.windows};
   LossTokenizer tokenizer;
-  const std::vector<EntryMark> marks = tokenizer.marks();
+  const std::vector<std::string_view> marks = tokenizer.marks();
   StoreReport facts;  // streams keep references to its files: see openFiles()
   size_t usableFiles = 0;
   ErrorCode firstFailure = ErrorCode::notAStore;  // why the first file is not usable

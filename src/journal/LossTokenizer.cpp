@@ -12,13 +12,20 @@ namespace {
 constexpr std::string_view kMessageId = "MESSAGE_ID";
 constexpr std::string_view kCount = "N_DROPPED";
 constexpr std::string_view kUnit = "OBJECT_SYSTEMD_UNIT";
-// The id that the daemon gives its message about suppressed entries.
+constexpr std::string_view kTransport = "_TRANSPORT";
+// The id that the daemon gives its message about suppressed entries, and the transport of all that
+// it writes itself. Fields that begin with an underscore come from the daemon, so nobody else can
+// send this transport.
 constexpr std::string_view kLossMessage = "a596d6fe7bfa4994828e72309e95d61e";
+constexpr std::string_view kDaemonItself = "driver";
+constexpr std::string_view kLossMark = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+constexpr std::string_view kCountMark = "N_DROPPED=";
 
-// Our tokens: one for the message, then 2^30 - 1 for counts, then one for each unit. The token of a
-// count holds the count itself, so different counts take no memory.
+// Our tokens: one for the message, one for the transport, then some 2^30 for counts, then one for
+// each unit. The token of a count holds the count itself, so different counts take no memory.
 constexpr FieldToken kLossToken = kFirstReservedToken;
-constexpr FieldToken kFirstCount = kFirstReservedToken + 1;
+constexpr FieldToken kDaemonToken = kFirstReservedToken + 1;
+constexpr FieldToken kFirstCount = kFirstReservedToken + 2;
 constexpr FieldToken kFirstUnit = kFirstReservedToken + 0x40000000;
 
 bool isOurs(FieldToken token) { return token >= kFirstReservedToken; }
@@ -35,28 +42,28 @@ FieldToken countToken(std::string_view value) {
 }  // namespace
 
 // A user without marks sees every entry, and one mark of ours would make the readers leave out the
-// rest.
-std::vector<EntryMark> LossTokenizer::marks() const {
-  std::vector<EntryMark> marks = user_.marks();
-  if (!marks.empty()) marks.push_back({kMessageId, kLossMessage});
+// rest. The count is a second mark of a loss message: if one of both is damaged, the other still
+// leads the reader to the entry.
+std::vector<std::string_view> LossTokenizer::marks() const {
+  std::vector<std::string_view> marks = user_.marks();
+  if (!marks.empty()) marks.insert(marks.end(), {kLossMark, kCountMark});
   return marks;
 }
 
 bool LossTokenizer::wants(std::string_view fieldName) const {
   return user_.wants(fieldName) || fieldName == kMessageId || fieldName == kCount ||
-         fieldName == kUnit;
+         fieldName == kUnit || fieldName == kTransport;
 }
 
 FieldToken LossTokenizer::tokenFor(std::string_view field, std::string_view value, uint64_t size) {
-  // Anyone can send this message id. So we count and show what the message says, but nothing else
-  // depends on it.
-  if (field == kMessageId && value == kLossMessage) {
-    met_ = true;
-    return kLossToken;
-  }
-  if (field == kCount) return countToken(value);
-  if (field == kUnit) return unitToken(value);
-  return user_.tokenFor(field, value, size);
+  FieldToken own = kNoToken;
+  if (field == kMessageId && value == kLossMessage) own = kLossToken;
+  if (field == kTransport && value == kDaemonItself) own = kDaemonToken;
+  if (field == kCount) own = countToken(value);
+  if (field == kUnit) own = unitToken(value);
+  if (own == kNoToken) return user_.tokenFor(field, value, size);
+  met_ = true;
+  return own;
 }
 
 FieldToken LossTokenizer::unitToken(std::string_view name) {
@@ -71,7 +78,7 @@ FieldToken LossTokenizer::unitToken(std::string_view name) {
 }
 
 std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> tokens) {
-  // Most stores have no loss message, and in the others nearly no entry is one. The greatest token
+  // Many stores have no such field, and in the others nearly no entry has one. The greatest token
   // tells, and the loop that finds it has no branch.
   if (!met_) return tokens;
   FieldToken highest = 0;
@@ -85,18 +92,21 @@ std::span<const FieldToken> LossTokenizer::takeOwn(std::span<const FieldToken> t
 
 void LossTokenizer::count(std::span<const FieldToken> tokens) {
   bool loss = false;
+  bool daemon = false;
   uint64_t number = 0;
   size_t unit = 0;
   for (const FieldToken token : tokens) {
     if (token == kLossToken) {
       loss = true;
+    } else if (token == kDaemonToken) {
+      daemon = true;
     } else if (token >= kFirstUnit) {
       unit = token - kFirstUnit;
     } else if (token >= kFirstCount) {
       number = token - kFirstCount;
     }
   }
-  if (loss) units_[unit].count += number;
+  if (loss && daemon) units_[unit].count += number;
 }
 
 void LossTokenizer::addDropped(Losses& losses) const {

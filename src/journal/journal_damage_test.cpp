@@ -31,6 +31,8 @@ using testing::JournalWriter;
 using testing::put;
 using testing::TemporaryDirectory;
 
+constexpr size_t kArenaSizeAt = 96;  // we do not believe it
+
 struct Outcome {
   std::vector<uint64_t> numbers;
   bool problemTold = false;
@@ -111,9 +113,6 @@ TEST_P(JournalDamageTest, FindsAllBehindADamagedHeader) {
     for (const size_t at :
          {kHeaderSizeAt, kArenaSizeAt, kTailObjectAt, kEntryCountAt, kEntryArrayAt}) {
       std::string file = writer.bytes();
-      // The reader believes an arena that is smaller than the file, and looks for no entry behind
-      // it.
-      if (at == kArenaSizeAt && wrong < file.size()) continue;
       put(file, at, wrong);
       const Outcome outcome = read(directory_.write("a.journal", file));
       EXPECT_EQ(outcome.numbers.size(), 1000u) << at << " " << wrong;

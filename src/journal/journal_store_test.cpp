@@ -190,10 +190,15 @@ TEST(JournalStoreTest, TellsWhatTheDaemonDropped) {
   EntryHeader header;
   header.realtime = header.monotonic = 1;
   const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
-  writer.add(header, {message, "N_DROPPED=12", "OBJECT_SYSTEMD_UNIT=a.service"});
-  writer.add(header, {"MESSAGE_ID=other", "N_DROPPED=100", "OBJECT_SYSTEMD_UNIT=a.service"});
-  writer.add(header, {message, "N_DROPPED=5", "OBJECT_SYSTEMD_UNIT=a.service", "PRIORITY=4"});
-  writer.add(header, {message, "N_DROPPED=1"});
+  const std::string daemon = "_TRANSPORT=driver";
+  writer.add(header, {message, "N_DROPPED=12", "OBJECT_SYSTEMD_UNIT=a.service", daemon});
+  writer.add(header,
+             {"MESSAGE_ID=other", "N_DROPPED=100", "OBJECT_SYSTEMD_UNIT=a.service", daemon});
+  writer.add(header,
+             {message, "N_DROPPED=5", "OBJECT_SYSTEMD_UNIT=a.service", "PRIORITY=4", daemon});
+  writer.add(header,
+             {message, "N_DROPPED=7", "OBJECT_SYSTEMD_UNIT=a.service", "_TRANSPORT=journal"});
+  writer.add(header, {message, "N_DROPPED=1", daemon});
   const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
   const auto& dropped = reading.report.reading.losses.all();
   ASSERT_EQ(dropped.size(), 2u);
@@ -211,15 +216,16 @@ TEST(JournalStoreTest, CountsEachOfManyLosses) {
   EntryHeader header;
   header.realtime = header.monotonic = 1;
   const std::string message = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  const std::string daemon = "_TRANSPORT=driver";
   constexpr uint64_t kLosses = 5000;
   static_assert(kLosses > LossTokenizer::kMaxUnits);
   for (uint64_t i = 1; i <= kLosses; ++i) {
     const std::string number = std::to_string(i);
-    writer.add(header, {message, "N_DROPPED=" + number, "OBJECT_SYSTEMD_UNIT=u" + number});
+    writer.add(header, {message, "N_DROPPED=" + number, "OBJECT_SYSTEMD_UNIT=u" + number, daemon});
   }
   const std::string tooLong(LossTokenizer::kMaxUnitLength + 1, 'u');
-  writer.add(header, {message, "N_DROPPED=1", "OBJECT_SYSTEMD_UNIT=" + tooLong});
-  writer.add(header, {message, "N_DROPPED=some"});
+  writer.add(header, {message, "N_DROPPED=1", "OBJECT_SYSTEMD_UNIT=" + tooLong, daemon});
+  writer.add(header, {message, "N_DROPPED=some", daemon});
   const Reading reading = readStore(directory.write("a.journal", writer.bytes()));
   const Losses& losses = reading.report.reading.losses;
   EXPECT_EQ(losses.sum(LossCode::droppedByDaemon), kLosses * (kLosses + 1) / 2 + 1);

@@ -45,11 +45,9 @@ FieldToken TracePointTable::malformedToken(FieldKind kind, MalformedReason reaso
 
 // Nearly every trace point has all required fields. So the reader follows only the first field's
 // list of entries, and uses the other fields to check that this list is enough.
-std::vector<EntryMark> TracePointTable::marks() const {
-  EntryMark mark{kJournalFields[0].name};
-  for (size_t i = 1; i < kRequiredFields; ++i) mark.companions.push_back(kJournalFields[i].name);
-  return {mark};
-}
+// Every field that makes an entry a trace point begins like this, and so do most others of it. So a
+// damaged field hides no trace point.
+std::vector<std::string_view> TracePointTable::marks() const { return {"TESSEL_"}; }
 
 bool TracePointTable::wants(std::string_view fieldName) const {
   return journalFieldNamed(fieldName) != nullptr;

@@ -38,7 +38,7 @@ class TracePointTable final : public FieldTokenizer {
  public:
   explicit TracePointTable(TracePointTableLimits limits = {});
 
-  std::vector<EntryMark> marks() const override;
+  std::vector<std::string_view> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return generation_; }

@@ -1,7 +1,8 @@
 // compare_readers [--ours|--stop-after MILLISECONDS] PATH
 //
 // PATH is a directory or a journal file. Four readers read it: ours, libsystemd, `journalctl -o
-// export`, and ours when it follows the index of TESSEL_KIND. The entries are compared one by one.
+// export`, and ours when only entries with a TESSEL_ field are wanted. The entries are compared one
+// by one.
 //
 // Prints the figures of our reader, then a line for each file with a problem, then a line for each
 // reader that differs from ours. The exit status is 1 if one differs. --ours reads with our reader
@@ -67,17 +68,17 @@ bool same(std::string_view name, const std::vector<PlainEntry>& ours,
   return false;
 }
 
-// Reads with the index of TESSEL_KIND. The reader may then deliver entries without a TESSEL_KIND
-// empty. We count those in `spared` and fill them in from the full reading, so that all compare.
-std::vector<PlainEntry> readLedByKind(const std::string& path, const std::vector<PlainEntry>& all,
-                                      size_t& spared) {
-  testing::RecordingTokenizer tokenizer({{"TESSEL_KIND"}});
+// Reads only entries with a TESSEL_ field. The reader may then deliver the others empty. We count
+// those in `spared` and fill them in from the full reading, so that all compare.
+std::vector<PlainEntry> readMarked(const std::string& path, const std::vector<PlainEntry>& all,
+                                   size_t& spared) {
+  testing::RecordingTokenizer tokenizer({"TESSEL_"});
   const StopFlag stop{false};
   auto opened = JournalStore::open(path, {}, tokenizer, stop);
   std::vector<PlainEntry> led = testing::readAll(std::get<0>(opened)->entries(), tokenizer);
   for (size_t i = 0; i < std::min(led.size(), all.size()); ++i) {
-    const auto isKind = [](const std::string& field) { return field.starts_with("TESSEL_KIND="); };
-    if (!led[i].fields.empty() || std::ranges::any_of(all[i].fields, isKind)) continue;
+    const auto isMark = [](const std::string& field) { return field.starts_with("TESSEL_"); };
+    if (!led[i].fields.empty() || std::ranges::any_of(all[i].fields, isMark)) continue;
     led[i].fields = all[i].fields;
     ++spared;
   }
@@ -97,7 +98,7 @@ int compare(const std::string& path, bool withOthers) {
       withOthers ? testing::readAll(store.entries(), tokenizer) : readHeaders(store.entries());
   const StoreReport report = store.report();
   size_t spared = 0;
-  const auto led = withOthers ? readLedByKind(path, ours, spared) : ours;
+  const auto marked = withOthers ? readMarked(path, ours, spared) : ours;
   std::cout << "entries " << ours.size() << " repeated " << repeated(ours) << " duplicates "
             << report.reading.duplicateEntries << " files " << report.files.size() << " spared "
             << spared << "\n";
@@ -107,7 +108,7 @@ int compare(const std::string& path, bool withOthers) {
   for (const FileReport& file : report.files) files.push_back(file.path);
   const bool libsystemd = same("libsystemd", ours, testing::readWithLibsystemd(files));
   const bool journalctl = same("journalctl", ours, testing::readWithJournalctl(path));
-  return same("the reader led by an index", ours, led) && libsystemd && journalctl ? 0 : 1;
+  return same("the reader of marked entries", ours, marked) && libsystemd && journalctl ? 0 : 1;
 }
 
 int stopMeanwhile(const std::string& path, std::chrono::milliseconds after) {

@@ -76,7 +76,7 @@ class Vandal {
         put(at & ~uint64_t{7}, anOffset());
         break;
       case 5:
-        put(kArenaSizeAt + below(18) * 8, anOffset());
+        put(kHeaderSizeAt + below(18) * 8, anOffset());
         break;
       case 6:
         put(kEntryCountAt, random_());

@@ -50,6 +50,10 @@ std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& t
 
 namespace {
 
+// The store needs this field itself, to tell the daemon's own messages from others, and does not
+// show it.
+constexpr std::string_view kKeptByStore = "_TRANSPORT=driver";
+
 PlainEntry currentEntry(sd_journal* journal) {
   PlainEntry plain;
   sd_id128_t boot{};
@@ -61,7 +65,7 @@ PlainEntry currentEntry(sd_journal* journal) {
   SD_JOURNAL_FOREACH_DATA(journal, data, length) {
     std::string field(static_cast<const char*>(data), std::min(length, kMaxFieldHead));
     if (length > kMaxFieldHead) field += "...";
-    plain.fields.push_back(std::move(field));
+    if (field != kKeptByStore) plain.fields.push_back(std::move(field));
   }
   std::sort(plain.fields.begin(), plain.fields.end());
   return plain;
@@ -99,6 +103,7 @@ std::vector<PlainEntry> readWithJournalctl(const std::string& path) {
   // In the export format the boot is a part of the header and not a field, so we add the field
   // here.
   for (PlainEntry& entry : entries) {
+    std::erase(entry.fields, kKeptByStore);
     entry.fields.push_back("_BOOT_ID=" + textOf(entry.header.bootId));
     std::sort(entry.fields.begin(), entry.fields.end());
   }

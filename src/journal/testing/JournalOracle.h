@@ -24,9 +24,10 @@ std::ostream& operator<<(std::ostream& out, const PlainEntry& entry);
 // Wants every field and gives each distinct text its own token.
 class RecordingTokenizer final : public FieldTokenizer {
  public:
-  explicit RecordingTokenizer(std::vector<EntryMark> marks = {}) : marks_(std::move(marks)) {}
+  explicit RecordingTokenizer(std::vector<std::string_view> marks = {})
+      : marks_(std::move(marks)) {}
 
-  std::vector<EntryMark> marks() const override { return marks_; }
+  std::vector<std::string_view> marks() const override { return marks_; }
   bool wants(std::string_view) const override { return true; }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
   uint32_t generation() const override { return 0; }
@@ -36,7 +37,7 @@ class RecordingTokenizer final : public FieldTokenizer {
   size_t shown() const { return shown_; }
 
  private:
-  const std::vector<EntryMark> marks_;
+  const std::vector<std::string_view> marks_;
   std::map<std::string, FieldToken, std::less<>> tokens_;
   std::vector<std::string> texts_;
   size_t shown_ = 0;

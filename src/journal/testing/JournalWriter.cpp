@@ -6,8 +6,10 @@
 
 #include <algorithm>
 #include <cstring>
+#include <span>
 
 #include "journal/JournalFormat.h"
+#include "journal/JournalHash.h"
 
 namespace tessel::testing {
 
@@ -41,12 +43,17 @@ std::string compressZstd(const std::string& text) {
   return out;
 }
 
+// Readers other than ours follow these; ours does not.
+constexpr size_t kArenaSizeAt = 96;
+constexpr size_t kDataTableAt = 104;
+constexpr size_t kFieldTableAt = 120;
+constexpr size_t kFieldCountAt = 216;
+constexpr size_t kDataFirstEntryAt = 40;
+constexpr size_t kDataEntryArrayAt = 48;
 constexpr uint64_t kBuckets = 8;
 
-uint64_t hashOf(const std::string& text) {
-  uint64_t hash = 14695981039346656037u;
-  for (const char c : text) hash = (hash ^ static_cast<uint8_t>(c)) * 1099511628211u;
-  return hash;
+std::span<const uint8_t> bytesOf(const std::string& text) {
+  return {reinterpret_cast<const uint8_t*>(text.data()), text.size()};
 }
 
 }  // namespace
@@ -54,7 +61,7 @@ uint64_t hashOf(const std::string& text) {
 JournalWriter::JournalWriter(JournalLayout layout) : layout_(layout) {
   file_.assign(layout_.headerSize, '\0');
   file_.replace(0, 8, kSignature, 8);
-  uint32_t flags = layout_.compact ? uint32_t{kCompact} : 0;
+  uint32_t flags = (layout_.compact ? kCompact : 0u) | (layout_.keyed ? kKeyedHash : 0u);
   if (layout_.compression == kXz) flags |= kCompressedXz;
   if (layout_.compression == kLz4) flags |= kCompressedLz4;
   if (layout_.compression == kZstd) flags |= kCompressedZstd;
@@ -66,11 +73,12 @@ JournalWriter::JournalWriter(JournalLayout layout) : layout_(layout) {
               file_.begin() + static_cast<ptrdiff_t>(at));
   put<uint64_t>(kHeaderSizeAt, layout_.headerSize);
   all_.firstAt = kEntryArrayAt;
-  // The table of data is there, and empty: nobody looks at it.
-  for (const auto& [type, at] : {std::pair(kDataHashTable, 104), std::pair(kFieldHashTable, 120)}) {
-    const uint64_t table = beginObject(type, 0, kObjectHeaderSize + kBuckets * kBucketSize);
-    put<uint64_t>(static_cast<uint64_t>(at), table + kObjectHeaderSize);
-    put<uint64_t>(static_cast<uint64_t>(at) + 8, kBuckets * kBucketSize);
+  // The tables are there, and empty: nobody looks at them.
+  for (const auto& [type, at] :
+       {std::pair(kDataHashTable, kDataTableAt), std::pair(kFieldHashTable, kFieldTableAt)}) {
+    const uint64_t table = beginObject(type, 0, kObjectHeaderSize + kBuckets * 16);
+    put<uint64_t>(at, table + kObjectHeaderSize);
+    put<uint64_t>(at + 8, kBuckets * 16);
   }
 }
 
@@ -99,10 +107,6 @@ uint64_t JournalWriter::beginObject(uint8_t type, uint8_t flags, uint64_t size) 
   return offset;
 }
 
-uint64_t JournalWriter::wordAt(uint64_t at) const {
-  return load<uint64_t>(reinterpret_cast<const uint8_t*>(file_.data()) + at);
-}
-
 JournalWriter::Data& JournalWriter::dataFor(const std::string& field) {
   const auto [known, isNew] = data_.try_emplace(field);
   Data& data = known->second;
@@ -116,24 +120,17 @@ JournalWriter::Data& JournalWriter::dataFor(const std::string& field) {
   data.offset =
       beginObject(kData, compressed ? layout_.compression : uint8_t{0}, before + payload.size());
   data.list.firstAt = data.offset + kDataEntryArrayAt;
-  put<uint64_t>(data.offset + 16, hashOf(field));
+  put<uint64_t>(data.offset + kDataHashAt, layout_.keyed
+                                               ? sipHash24(bytesOf(field), layout_.sequenceId)
+                                               : lookup3(bytesOf(field)));
   file_.replace(data.offset + before, payload.size(), payload);
-  const uint64_t owner = fieldFor(field.substr(0, field.find('=')));
-  put<uint64_t>(data.offset + kNextValueAt, wordAt(owner + kFieldFirstValueAt));
-  put<uint64_t>(owner + kFieldFirstValueAt, data.offset);
+  const std::string name = field.substr(0, field.find('='));
+  if (fields_.insert(name).second) {
+    const uint64_t object = beginObject(kField, 0, kFieldHeaderSize + name.size());
+    file_.replace(object + kFieldHeaderSize, name.size(), name);
+    if (layout_.headerSize > kFieldCountAt) put<uint64_t>(kFieldCountAt, fields_.size());
+  }
   return data;
-}
-
-uint64_t JournalWriter::fieldFor(const std::string& name) {
-  const auto [known, isNew] = fields_.try_emplace(name);
-  if (!isNew) return known->second;
-  const uint64_t field = beginObject(kField, 0, kFieldHeaderSize + name.size());
-  file_.replace(field + kFieldHeaderSize, name.size(), name);
-  const uint64_t bucket = wordAt(kFieldTableAt) + hashOf(name) % kBuckets * kBucketSize;
-  put<uint64_t>(field + kNextInBucketAt, wordAt(bucket));
-  put<uint64_t>(bucket, field);
-  if (layout_.headerSize >= kHeaderRead) put<uint64_t>(kFieldCountAt, fields_.size());
-  return known->second = field;
 }
 
 void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fields) {
@@ -141,7 +138,7 @@ void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fiel
   uint64_t hash = 0;
   for (const std::string& field : fields) {
     items.push_back(&dataFor(field));
-    hash ^= hashOf(field);
+    hash ^= lookup3(bytesOf(field));
   }
   std::sort(items.begin(), items.end(),
             [](const Data* a, const Data* b) { return a->offset < b->offset; });
@@ -166,7 +163,7 @@ void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fiel
   }
   put<uint64_t>(160, sequence_);
   put<uint64_t>(kTailRealtimeAt, header.realtime);
-  put<uint64_t>(200, header.monotonic);
+  put<uint64_t>(kTailMonotonicAt, header.monotonic);
   std::copy(header.bootId.begin(), header.bootId.end(), file_.begin() + 56);
   if (layout_.sealEvery != 0 && entries_.size() % layout_.sealEvery == 0)
     beginObject(kTag, 0, kTagSize);

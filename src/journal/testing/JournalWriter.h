@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <map>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -16,6 +17,7 @@ namespace tessel::testing {
 
 struct JournalLayout {
   bool compact = false;
+  bool keyed = false;
   uint8_t compression = 0;   // of journal_format::DataFlag
   size_t compressFrom = 64;  // bytes
   uint64_t headerSize = 256;
@@ -59,10 +61,8 @@ class JournalWriter {
 
   uint64_t beginObject(uint8_t type, uint8_t flags, uint64_t size);
   Data& dataFor(const std::string& field);
-  uint64_t fieldFor(const std::string& name);
   void link(List& list, uint64_t entry);
   void link(Data& data, uint64_t entry);
-  uint64_t wordAt(uint64_t at) const;
   template <typename T>
   void put(uint64_t at, T value);
   size_t offsetSize() const { return layout_.compact ? 4 : 8; }
@@ -71,7 +71,7 @@ class JournalWriter {
   JournalLayout layout_;
   std::string file_;
   std::map<std::string, Data> data_;
-  std::map<std::string, uint64_t> fields_;
+  std::set<std::string> fields_;
   std::vector<uint64_t> entries_;
   List all_;
   uint64_t objects_ = 0;

@@ -1,0 +1,114 @@
+// Both hashes, written after the public descriptions of the algorithms.
+
+#include "journal/JournalHash.h"
+
+#include <bit>
+
+#include "journal/JournalFormat.h"
+
+namespace tessel {
+
+using journal_format::load;
+
+namespace {
+
+struct Lookup3State {
+  uint32_t a, b, c;
+
+  void mix() {
+    turn(a, c, b, 4);
+    turn(b, a, c, 6);
+    turn(c, b, a, 8);
+    turn(a, c, b, 16);
+    turn(b, a, c, 19);
+    turn(c, b, a, 4);
+  }
+  void finish() {
+    fold(c, b, 14);
+    fold(a, c, 11);
+    fold(b, a, 25);
+    fold(c, b, 16);
+    fold(a, c, 4);
+    fold(b, a, 14);
+    fold(c, b, 24);
+  }
+
+ private:
+  static void turn(uint32_t& x, uint32_t& y, uint32_t z, int bits) {
+    x -= y;
+    x ^= std::rotl(y, bits);
+    y += z;
+  }
+  static void fold(uint32_t& x, uint32_t y, int bits) {
+    x ^= y;
+    x -= std::rotl(y, bits);
+  }
+};
+
+// The word of up to `size` bytes at `at`; absent bytes are zero.
+template <typename Word>
+Word partOfWord(const uint8_t* at, size_t size) {
+  Word word = 0;
+  for (size_t i = 0; i < size && i < sizeof word; ++i) word |= Word{at[i]} << (8 * i);
+  return word;
+}
+
+struct SipState {
+  uint64_t v0, v1, v2, v3;
+
+  void round() {
+    v0 += v1;
+    v2 += v3;
+    v1 = std::rotl(v1, 13) ^ v0;
+    v3 = std::rotl(v3, 16) ^ v2;
+    v0 = std::rotl(v0, 32) + v3;
+    v2 += v1;
+    v3 = std::rotl(v3, 21) ^ v0;
+    v1 = std::rotl(v1, 17) ^ v2;
+    v2 = std::rotl(v2, 32);
+  }
+  void take(uint64_t word) {
+    v3 ^= word;
+    round();
+    round();
+    v0 ^= word;
+  }
+};
+
+}  // namespace
+
+uint64_t lookup3(std::span<const uint8_t> bytes) {
+  const uint8_t* at = bytes.data();
+  size_t left = bytes.size();
+  const uint32_t start = 0xdeadbeef + static_cast<uint32_t>(left);
+  Lookup3State state{start, start, start};
+  for (; left > 12; left -= 12, at += 12) {
+    state.a += load<uint32_t>(at);
+    state.b += load<uint32_t>(at + 4);
+    state.c += load<uint32_t>(at + 8);
+    state.mix();
+  }
+  if (left > 0) {
+    state.a += partOfWord<uint32_t>(at, left);
+    if (left > 4) state.b += partOfWord<uint32_t>(at + 4, left - 4);
+    if (left > 8) state.c += partOfWord<uint32_t>(at + 8, left - 8);
+    state.finish();
+  }
+  return uint64_t{state.c} << 32 | state.b;
+}
+
+uint64_t sipHash24(std::span<const uint8_t> bytes, const Id128& key) {
+  const uint64_t k0 = load<uint64_t>(key.data());
+  const uint64_t k1 = load<uint64_t>(key.data() + 8);
+  SipState state{k0 ^ 0x736f6d6570736575, k1 ^ 0x646f72616e646f6d, k0 ^ 0x6c7967656e657261,
+                 k1 ^ 0x7465646279746573};
+  const uint8_t* at = bytes.data();
+  size_t left = bytes.size();
+  for (; left >= 8; left -= 8, at += 8) state.take(load<uint64_t>(at));
+  state.take(partOfWord<uint64_t>(at, left) | uint64_t{bytes.size()} << 56);
+  state.v2 ^= 0xff;
+  for (int i = 0; i < 4; ++i) state.round();
+  return state.v0 ^ state.v1 ^ state.v2 ^ state.v3;
+}
+
+}  // namespace tessel
