@@ -1,5 +1,6 @@
 // Any bytes as the tasking configuration: only a dictionary whose TaskedOn is a number other than
-// zero may switch reporting on.
+// zero may switch reporting on. A dictionary that is switched on is on, with the same other
+// members.
 
 #include <cstdint>
 #include <cstdlib>
@@ -20,6 +21,17 @@ bool mayReport(const ConfigurationValue* configuration) {
   return number != nullptr && booleanValue(*number);
 }
 
+void checkSwitchingOn(std::string_view text, const ConfigurationValue& configuration) {
+  const auto* before = std::get_if<ConfigurationValue::Dictionary>(&configuration.value);
+  if (before == nullptr) return;
+  const auto changed = parseConfiguration(withMember(text, "TaskedOn", "true"));
+  if (!mayReport(changed.get())) std::abort();
+  const auto& after = std::get<ConfigurationValue::Dictionary>(changed->value);
+  if (after.size() != before->size() + (before->contains("TaskedOn") ? 0 : 1)) std::abort();
+  for (const auto& member : *before)
+    if (!after.contains(member.first)) std::abort();
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -29,6 +41,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
                            configuration.get(), "com.vantor.performance.tessel_reporter_tasking")
                            .on();
   if (decided != mayReport(configuration.get())) std::abort();
+  if (configuration) checkSwitchingOn(text, *configuration);
   if (decided && text.find("TaskedOn") == std::string_view::npos &&
       text.find('\\') == std::string_view::npos)
     std::abort();

@@ -32,6 +32,7 @@ constexpr struct {
     {"Could not clear cookie file: ", "9cb66619cda440b487900bffc379e114"},
     {"Failed to process tessel data due to error: ", "a945202e0c6242889cfdf3bf6a9058b7"},
     {"Not reporting ", "aab21dd8ab154e9e9b6bcf90786745c9"},
+    {"The configuration cannot be looked at: ", "f1c07d1b6f4f4c0c9f2bd3e0a7b5e894"},
     {"Trying to stop in-flight reporting work.", "028e77c9a30243d590fb466bdd747234"},
     {"Done processing ", "23f0765b490247bfb6e565c7b662573f"},
     {"The run failed: ", "b7de085a430a4ebb9409220443622161"},

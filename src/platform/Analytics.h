@@ -51,6 +51,9 @@ class ConfigurationObserver {
   virtual void setDelegate(std::shared_ptr<ConfigurationObserverDelegate> delegate,
                            std::shared_ptr<SerialQueue> queue) = 0;
   virtual void startObserving(const std::string& type) = 0;
+  // Whether this process lacks what it needs to look at the configuration, such as descriptors.
+  // That there was no call then says nothing about the configuration.
+  virtual bool blind() const { return false; }
 };
 
 class ConfigurationService {

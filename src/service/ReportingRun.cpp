@@ -162,7 +162,11 @@ void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity
 
 RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
   status_.say("waiting for the tasking configuration");
-  if (!gate_.shouldReport()) return endedWith(RunOutcome::notTasked);
+  const TaskingDecision decision = gate_.decide();
+  // Nobody knows whether this machine is tasked, so the run must not pass for one that was not.
+  if (decision.reason == TaskingReason::notLookedAt)
+    return endedWith(RunOutcome::failed, "the tasking configuration could not be looked at");
+  if (!decision.on()) return endedWith(RunOutcome::notTasked);
   if (cookie_.cookieFileExists()) {
     // What the dead run read may have killed it, so this run reads nothing. It removes the marker,
     // so the next run reads again.

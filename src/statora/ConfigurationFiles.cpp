@@ -1,10 +1,11 @@
 // Reading configurations and watching their files.
 //
 // A file is watched in two ways at once. inotify on its directory tells of a change within a
-// millisecond. It misses some changes: a directory that is made later, a link on the path that is
-// replaced, a file system without notifications. So we also look every quarter of a second, which
-// costs one read of a small file. Watching every directory of the path was discarded: it needs far
-// more code and would still miss the third kind.
+// millisecond; while the directory is missing, inotify on the nearest one above it tells of its
+// making. That matters, because the gate waits only 5 s, and what is written in their last moments
+// must still arrive. inotify misses some changes: in a file that a link leads to, on a file system
+// without notifications. So we also look every 50 ms, which costs one read of a small file. An
+// observer lives for one wait of the gate, so that is at most 100 reads a run.
 
 #include "statora/ConfigurationFiles.h"
 
@@ -14,129 +15,64 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
+#include <atomic>
 #include <cerrno>
 #include <chrono>
-#include <limits>
-#include <nlohmann/json.hpp>
+#include <filesystem>
 #include <system_error>
 #include <thread>
 #include <utility>
-#include <vector>
 
 #include "os/Files.h"
 #include "os/UniqueFd.h"
+#include "platform/Log.h"
 
 namespace tessel {
 
-namespace {
-
-using Json = nlohmann::json;
-
-// Builds the value from the parser's events. A finished document was discarded, because it would be
-// built before we could bound its depth. Each handler answers whether parsing goes on.
-class Builder final : public nlohmann::json_sax<Json> {
- public:
-  bool null() override { return add({}); }
-  bool boolean(bool value) override { return add({Number{value}}); }
-  bool number_integer(int64_t value) override { return add({Number{value}}); }
-  bool number_unsigned(uint64_t value) override {
-    const bool fitsSigned = value <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max());
-    return add({fitsSigned ? Number{static_cast<int64_t>(value)} : Number{value}});
-  }
-  bool number_float(double value, const std::string& /*text*/) override {
-    return add({Number{value}});
-  }
-  bool string(std::string& value) override { return add({std::move(value)}); }
-  bool binary(Json::binary_t& /*value*/) override { return false; }
-
-  bool start_object(size_t /*size*/) override { return open({ConfigurationValue::Dictionary{}}); }
-  bool start_array(size_t /*size*/) override { return open({ConfigurationValue::List{}}); }
-  bool end_object() override { return closeInnermost(); }
-  bool end_array() override { return closeInnermost(); }
-  bool key(std::string& name) override {
-    open_.back().key = std::move(name);
-    return true;
-  }
-  bool parse_error(size_t /*position*/, const std::string& /*token*/,
-                   const Json::exception& /*error*/) override {
-    return false;
-  }
-
-  ConfigurationValue take() { return std::move(root_); }
-
- private:
-  struct Open {
-    ConfigurationValue value;
-    std::string key;  // of the member that is being read
-  };
-
-  bool open(ConfigurationValue container) {
-    if (open_.size() == kMaxConfigurationDepth) return false;
-    open_.push_back({std::move(container), {}});
-    return true;
-  }
-  bool closeInnermost() {
-    ConfigurationValue finished = std::move(open_.back().value);
-    open_.pop_back();
-    return add(std::move(finished));
-  }
-  bool add(ConfigurationValue value) {
-    if (open_.empty()) {
-      root_ = std::move(value);
-    } else if (auto* list = std::get_if<ConfigurationValue::List>(&open_.back().value.value)) {
-      list->push_back(std::move(value));
-    } else {
-      auto& dictionary = std::get<ConfigurationValue::Dictionary>(open_.back().value.value);
-      dictionary.insert_or_assign(std::move(open_.back().key), std::move(value));
-    }
-    return true;
-  }
-
-  std::vector<Open> open_;
-  ConfigurationValue root_;
-};
-
-}  // namespace
-
-std::shared_ptr<const ConfigurationValue> parseConfiguration(std::string_view text) {
-  // The parser takes a null byte for the end and would accept whatever follows.
-  if (text.find('\0') != std::string_view::npos) return nullptr;
-  Builder builder;
-  if (!Json::sax_parse(text.begin(), text.end(), &builder)) return nullptr;
-  return std::make_shared<const ConfigurationValue>(builder.take());
-}
-
-std::optional<ConfigurationChanges::Report> ConfigurationChanges::look(ConfigurationFile seen) {
+std::optional<ConfigurationChanges::Report> ConfigurationChanges::look(ConfigurationFile seen,
+                                                                       Time now, bool done) {
   if (seen == told_) {
-    unconfirmed_.reset();
+    doubt_.reset();
     return {};
   }
   auto configuration = seen.text ? parseConfiguration(*seen.text) : nullptr;
-  if (!configuration && unconfirmed_ != seen) {
-    unconfirmed_ = std::move(seen);
-    return {};
+  // Some make an empty file first and open it once more to write it, so an empty one is never done.
+  const bool final = done && seen.text && !seen.text->empty();
+  if (!configuration && !final) {
+    if (!doubt_ || doubt_->seen != seen) doubt_ = {std::move(seen), now};
+    if (now < *confirmsAt()) return {};
+    seen = std::move(doubt_->seen);
   }
-  unconfirmed_.reset();
+  doubt_.reset();
   told_ = std::move(seen);
   // The delegate knows of one absence only, so another reason for it is no change.
   if (std::exchange(absenceTold_, !configuration) && !configuration) return {};
   return Report{std::move(configuration)};
 }
 
-namespace {
+std::optional<ConfigurationChanges::Time> ConfigurationChanges::confirmsAt() const {
+  return doubt_ ? std::optional(doubt_->since + kPatience) : std::nullopt;
+}
 
-constexpr std::chrono::milliseconds kLookInterval{250};
-
-// Keeps a file that cannot be read apart from a missing one. An absence needs two equal looks, so a
-// file that is replaced (unreadable, then missing, then there) is not taken for absent.
-ConfigurationFile readFile(const std::string& path) {
+// An error of the kernel's that is about this process or the machine, and not about the file.
+std::variant<ConfigurationFile, PlatformError> lookAtConfiguration(const std::string& path) {
+  errno = 0;
   auto text = readSmallFile(path, FileConfigurationService::kMaxFileBytes);
-  if (text) return {true, std::move(text)};
+  if (text) return ConfigurationFile{true, std::move(text)};
+  if (errno == EMFILE || errno == ENFILE || errno == ENOMEM || errno == EINTR)
+    return fileError(path, errno);
+  // A file that cannot be read is kept apart from a missing one. A file that is replaced may be
+  // unreadable, then missing, then there: each of these looks begins the doubt anew.
   struct stat facts {};
   const bool missing = ::stat(path.c_str(), &facts) != 0 && (errno == ENOENT || errno == ENOTDIR);
-  return {!missing, {}};
+  return ConfigurationFile{!missing, {}};
 }
+
+namespace {
+
+constexpr std::chrono::milliseconds kLookInterval{50};
 
 // What the watching thread works on. The observer shares it, to end the thread through `ended`.
 struct Watch {
@@ -150,30 +86,67 @@ struct Watch {
   const std::string path;
   const UniqueFd inotify{::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)};
   const UniqueFd ended{::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)};
+  // Whether the last look failed for a lack of this process' own.
+  std::atomic<bool> blind{false};
 
-  // Watches the directory that the path leads to now. Called before every look, because a link on
-  // the path may have changed. A second call for the same directory adds nothing, and the kernel
-  // drops the watch of a directory that is gone.
-  void watchDirectory() const {
-    ::inotify_add_watch(
-        inotify.get(), directory.c_str(),
-        IN_CLOSE_WRITE | IN_MODIFY | IN_CREATE | IN_DELETE | IN_MOVE | IN_ATTRIB | IN_ONLYDIR);
+  // Watches the directory that the path leads to now, or the nearest one above it that is there.
+  // Called before every look, because a link on the path may have changed. A second call for the
+  // same directory adds nothing, and the kernel drops the watch of a directory that is gone.
+  void watchDirectory() {
+    std::filesystem::path nearest, before;
+    do {
+      // A directory that was made after we had looked for it, and before we watched the one above
+      // it, would stay unseen. So we look until nothing new turns up.
+      before = nearest;
+      nearest = directory;
+      watched_ = watch(nearest, IN_CLOSE_WRITE | IN_MODIFY | IN_DELETE | IN_ATTRIB | kNewNames);
+      // Above the directory only new names matter. Busy directories have many other events.
+      for (int above = watched_; above < 0 && nearest.has_relative_path();) {
+        nearest = nearest.parent_path();
+        above = watch(nearest, kNewNames);
+      }
+    } while (watched_ < 0 && nearest != before);
   }
 
-  // True if something happened or `timeout` passed. False if the observer is gone or waiting fails.
-  // Without `heedEvents` only time counts: a burst of events must not confirm an absence too soon.
-  bool wait(std::chrono::milliseconds timeout, bool heedEvents) const {
-    std::array<pollfd, 2> waited{
-        {{ended.get(), POLLIN, 0}, {heedEvents ? inotify.get() : -1, POLLIN, 0}}};
-    if (::poll(waited.data(), waited.size(), static_cast<int>(timeout.count())) < 0 &&
+  // False if the observer is gone or waiting fails. Otherwise something happened or `until` came.
+  bool waitUntil(ConfigurationChanges::Time until) {
+    // Rounded up: a wait that ends too early would end again and again.
+    const auto timeout =
+        std::chrono::ceil<std::chrono::milliseconds>(until - std::chrono::steady_clock::now());
+    std::array<pollfd, 2> waited{{{ended.get(), POLLIN, 0}, {inotify.get(), POLLIN, 0}}};
+    if (::poll(waited.data(), waited.size(), std::max(static_cast<int>(timeout.count()), 0)) < 0 &&
         errno != EINTR)
       return false;
-    // The events are discarded unread, because the look that follows shows what has changed.
-    std::array<char, 4096> discarded{};
-    while (::read(inotify.get(), discarded.data(), discarded.size()) > 0) {
-    }
+    readEvents();
     return waited[0].revents == 0;
   }
+
+  // Whether the last event of the file was its writer's last: he closed it or moved it here.
+  bool writerIsDone() const { return writerIsDone_; }
+
+ private:
+  static constexpr uint32_t kNewNames = IN_CREATE | IN_MOVE;
+
+  int watch(const std::filesystem::path& place, uint32_t events) const {
+    return ::inotify_add_watch(inotify.get(), place.c_str(), events | IN_ONLYDIR);
+  }
+
+  void readEvents() {
+    writerIsDone_ = false;
+    alignas(inotify_event) std::array<char, 4096> buffer{};
+    ssize_t size = 0;
+    while ((size = ::read(inotify.get(), buffer.data(), buffer.size())) > 0) {
+      for (ssize_t place = 0; place < size;) {
+        const auto* event = reinterpret_cast<const inotify_event*>(buffer.data() + place);
+        if (event->wd == watched_ && event->len != 0 && type + ".json" == event->name)
+          writerIsDone_ = (event->mask & (IN_CLOSE_WRITE | IN_MOVED_TO)) != 0;
+        place += static_cast<ssize_t>(sizeof *event + event->len);
+      }
+    }
+  }
+
+  int watched_ = -1;  // the watch of the directory itself; -1 if only one above it is watched
+  bool writerIsDone_ = false;
 };
 
 class FileObserver final : public ConfigurationObserver,
@@ -200,24 +173,43 @@ class FileObserver final : public ConfigurationObserver,
       std::thread([watch = watch_, observer = weak_from_this()] {
         observe(*watch, observer);
       }).detach();
-    } catch (const std::system_error&) {
-      // Without a thread the delegate is never called, as if there were no configuration. The
-      // service then works without it.
+    } catch (const std::system_error& error) {
+      // Without a thread the delegate is never called. That is no word on the configuration.
+      sayBlind(*watch_, {ErrorCode::failed, error.what()});
     }
   }
 
+  bool blind() const override { return watch_ && watch_->blind; }
+
  private:
-  static void observe(const Watch& watch, const std::weak_ptr<FileObserver>& observer) {
+  static void observe(Watch& watch, const std::weak_ptr<FileObserver>& observer) {
     ConfigurationChanges changes;
+    ConfigurationChanges::Time next;
     do {
       watch.watchDirectory();
-      if (auto report = changes.look(readFile(watch.path))) {
+      auto seen = lookAtConfiguration(watch.path);
+      const auto now = std::chrono::steady_clock::now();
+      next = now + kLookInterval;
+      if (const auto* error = std::get_if<PlatformError>(&seen)) {
+        sayBlind(watch, *error);
+        continue;
+      }
+      watch.blind = false;
+      auto report =
+          changes.look(std::get<ConfigurationFile>(std::move(seen)), now, watch.writerIsDone());
+      if (report) {
         // The thread must not keep the observer alive, or dropping it would never end the thread.
         const auto target = observer.lock();
         if (!target) return;
         target->deliver(std::move(report->configuration), watch.type);
       }
-    } while (watch.wait(kLookInterval, !changes.unconfirmed()) && !observer.expired());
+      if (const auto confirms = changes.confirmsAt()) next = std::min(next, *confirms);
+    } while (watch.waitUntil(next) && !observer.expired());
+  }
+
+  static void sayBlind(Watch& watch, const PlatformError& error) {
+    if (!watch.blind.exchange(true))
+      platformLog().warning("The configuration cannot be looked at: %@", error.words);
   }
 
   void deliver(std::shared_ptr<const ConfigurationValue> configuration, const std::string& type) {

@@ -53,17 +53,57 @@ TEST(ConfigurationJsonTest, TheLastOfEqualKeysCounts) {
 }
 
 TEST(ConfigurationJsonTest, NonsenseIsNoConfiguration) {
-  const std::string deep(kMaxConfigurationDepth + 1, '[');
   const std::string endless(1 << 20, '[');
   for (const std::string& text :
        {std::string(), std::string("{\"TaskedOn\":true"), std::string("{\"TaskedOn\":true}x"),
         std::string("{}{}"), std::string("{'TaskedOn':true}"), std::string("{\"TaskedOn\":TRUE}"),
-        std::string("[1e999]"), std::string("[\"\xff\"]"), std::string("[1,]"),
-        std::string("{}\0", 3), deep + std::string(deep.size(), ']'), endless}) {
+        std::string("[\"\xff\"]"), std::string("[1,]"), std::string("{}\0", 3),
+        std::string("[1e999"), std::string("[1e999,01e999]"), std::string("[1e999,-]"), endless}) {
     EXPECT_EQ(parseConfiguration(text), nullptr) << text.substr(0, 60);
   }
-  const std::string allowed(kMaxConfigurationDepth, '[');
-  EXPECT_NE(parseConfiguration(allowed + std::string(allowed.size(), ']')), nullptr);
+}
+
+TEST(ConfigurationJsonTest, AnOddMemberIsNullAndHarmsNoOther) {
+  const auto nested = [](size_t levels) {
+    return std::string(levels, '[') + "1" + std::string(levels, ']');
+  };
+  const std::string digits(400, '9');
+  for (const std::string& odd :
+       {std::string("1e400"), "-" + digits, digits + ".5", std::string("[[1e999], {\"x\": 1e999}]"),
+        nested(kMaxConfigurationDepth), nested(200'000),
+        "{\"a\":" + nested(kMaxConfigurationDepth) + ",\"b\":{}}"}) {
+    SCOPED_TRACE(odd.substr(0, 60));
+    const auto configuration = parseConfiguration("{\"1e400\":0,\"odd\":" + odd +
+                                                  ",\"TaskedOn\":true,\"after\":\"\\\"1e400\"}");
+    ASSERT_NE(configuration, nullptr);
+    const auto& dictionary = std::get<ConfigurationValue::Dictionary>(configuration->value);
+    ASSERT_EQ(dictionary.size(), 4u);
+    EXPECT_EQ(std::get<Number>(dictionary.at("TaskedOn").value), Number{true});
+    EXPECT_EQ(std::get<std::string>(dictionary.at("after").value), "\"1e400");
+    size_t depth = 0;
+    for (const ConfigurationValue* value = &dictionary.at("odd");; ++depth) {
+      const auto* list = std::get_if<ConfigurationValue::List>(&value->value);
+      if (list == nullptr || list->empty()) break;
+      value = &list->front();
+    }
+    EXPECT_LT(depth, kMaxConfigurationDepth);
+  }
+}
+
+TEST(ConfigurationJsonTest, AMemberIsChangedInItsPlace) {
+  const struct {
+    const char* text;
+    const char* changed;
+  } cases[] = {
+      {"{}", R"({"on": true})"},
+      {" { } \n", " {\"on\": true } \n"},
+      {R"({"a": 1e400, "on" : [1, {"on": 2}] ,"b":2.50})",
+       R"({"a": 1e400, "on" : true ,"b":2.50})"},
+      {R"({"on":1,"x":{"on":2},"on":"}"})", R"({"on":1,"x":{"on":2},"on":true})"},
+      {"{\n  \"x\": [\"on\"]\n}\n", "{\n  \"x\": [\"on\"], \"on\": true\n}\n"},
+      {R"({"\u006fn":false})", R"({"\u006fn":true})"},
+  };
+  for (const auto& c : cases) EXPECT_EQ(withMember(c.text, "on", "true"), c.changed);
 }
 
 const ConfigurationFile kNone{false, {}};
@@ -74,7 +114,8 @@ TEST(ConfigurationChangesTest, AbsenceIsToldWhenItLasts) {
   const struct {
     const char* what;
     std::vector<ConfigurationFile> looks;
-    const char* told;  // a letter a look: c a configuration, a its absence, - nothing
+    const char* told;      // a letter a look: c a configuration, a its absence, - nothing
+    const char* how = "";  // a letter a look: d its writer is done, s soon after the one before
   } cases[] = {
       {"never a file", {kNone, kNone, kNone}, "---"},
       {"made, changed, touched", {kNone, holding("1"), holding("2"), holding("2")}, "-cc-"},
@@ -87,6 +128,9 @@ TEST(ConfigurationChangesTest, AbsenceIsToldWhenItLasts) {
       {"left half written", {holding("{"), holding("{"), holding("{")}, "-a-"},
       {"gone for a moment", {holding("1"), kNone, holding("1")}, "c--"},
       {"gone, then back as it was", {holding("1"), kNone, kNone, kNone, holding("1")}, "c-a-c"},
+      {"closed half written", {kNone, holding("{"), kUnreadable}, "-a-", "-dd"},
+      {"closed empty, then written", {holding(""), holding("{}")}, "-c", "ds"},
+      {"looked at again and again", {holding("{"), holding("{"), holding("{")}, "---", "-ss"},
       {"absent for one reason after another",
        {holding("1"), kNone, kNone, kUnreadable, kUnreadable},
        "c-a--"},
@@ -94,9 +138,13 @@ TEST(ConfigurationChangesTest, AbsenceIsToldWhenItLasts) {
   for (const auto& c : cases) {
     SCOPED_TRACE(c.what);
     ConfigurationChanges changes;
+    ConfigurationChanges::Time now{};
+    std::string how = c.how;
+    how.resize(c.looks.size(), '-');
     std::string told;
-    for (const ConfigurationFile& seen : c.looks) {
-      const auto report = changes.look(seen);
+    for (size_t look = 0; look < c.looks.size(); ++look) {
+      now += how[look] == 's' ? std::chrono::milliseconds{10} : ConfigurationChanges::kPatience;
+      const auto report = changes.look(c.looks[look], now, how[look] == 'd');
       told += !report ? '-' : report->configuration ? 'c' : 'a';
     }
     EXPECT_EQ(told, c.told);
@@ -232,7 +280,6 @@ TEST_F(FileConfigurationServiceTest, NonsenseIsAbsent) {
              kFile,
              "{\"v\":\"" + std::string(FileConfigurationService::kMaxFileBytes, 'x') + "\"}");
        }},
-      {"nested", [&] { directory_.write(kFile, std::string(5000, '[') + std::string(5000, ']')); }},
       {"a directory", [&] { std::filesystem::create_directory(file); }},
       {"a pipe", [&] { ASSERT_EQ(mkfifo(file.c_str(), 0600), 0); }},
       {"a link to itself", [&] { ASSERT_EQ(symlink(file.c_str(), file.c_str()), 0); }},

@@ -32,6 +32,8 @@ constexpr ReasonRow kReasons[] = {
      "Not reporting based on not being tasked-on by Statora ('TaskedOn' is false)"},
     {TaskingReason::noneArrived, TaskingSource::absent,
      "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"},
+    {TaskingReason::notLookedAt, TaskingSource::unknown,
+     "Not reporting based on not being tasked-on by Statora (Timeout waiting for config)"},
     // This line names the type that arrived, so logged() writes it.
     {TaskingReason::unexpectedType, TaskingSource::unusable, ""},
     {TaskingReason::nilConfiguration, TaskingSource::unusable,
@@ -133,7 +135,8 @@ TaskingDecision TaskingGate::awaitTaskingConfiguration() {
                             }),
                         queue);
   observer->startObserving(kTaskingType);
-  if (!clock_.wait(answer->arrived, kConfigurationWait)) return {TaskingReason::noneArrived};
+  if (!clock_.wait(answer->arrived, kConfigurationWait))
+    return {observer->blind() ? TaskingReason::notLookedAt : TaskingReason::noneArrived};
   return answer->decision;
 }
 

@@ -32,6 +32,7 @@ enum class TaskingReason : uint8_t {
   taskedOn,
   taskedOff,
   noneArrived,     // the gate's wait ended before a configuration arrived
+  notLookedAt,     // as before, because this process lacked what it needs to look at it
   unexpectedType,  // a configuration arrived, but not the tasking configuration
   nilConfiguration,
   noDictionary,
@@ -45,6 +46,7 @@ enum class TaskingSource : uint8_t {
   configuration,  // the configuration says yes or no
   absent,         // no configuration arrived
   unusable,       // something arrived, but it says neither yes nor no
+  unknown,        // whether there is a configuration could not be found out
 };
 
 struct TaskingDecision {

@@ -3,7 +3,8 @@
 //
 //   FAULT_PATH     the faults strike files whose path contains this text
 //   FAULT_CALL     only this call counts, for example "flock"; by default every call that changes a
-//                  file: open for creating, write, truncate, flush, map, rename, remove
+//                  file: open for creating, write, truncate, flush, map, rename, remove.
+//                  "open_existing" is an open that may not create
 //   FAULT_AT       number of the first call that fails; 1 is the first on such a file
 //   FAULT_TIMES    how many calls in a row fail; by default all that follow
 //   FAULT_ERRNO    the error of a call that fails; 0 kills the process before the call
@@ -71,10 +72,11 @@ static void writeCount(long count) {
   syscall(SYS_close, file);
 }
 
-// A lock changes no file, so it counts only where FAULT_CALL names it.
+// A lock or a mere look changes no file, so these count only where FAULT_CALL names them.
 static int counts(const char* name) {
   const char* wanted = getenv("FAULT_CALL");
-  return strcmp(name, wanted != NULL ? wanted : "flock") == 0 ? wanted != NULL : wanted == NULL;
+  if (wanted != NULL) return strcmp(name, wanted) == 0;
+  return strcmp(name, "flock") != 0 && strcmp(name, "open_existing") != 0;
 }
 
 // Whether the call must fail; then errno is set.
@@ -129,7 +131,7 @@ static void keepDurable(int fd) {
 }
 
 static int opened(const char* path, int flags) {
-  return (flags & O_CREAT) != 0 && struck("open", path) ? -1 : 0;
+  return struck((flags & O_CREAT) != 0 ? "open" : "open_existing", path) ? -1 : 0;
 }
 
 #define OPEN(name)                                            \

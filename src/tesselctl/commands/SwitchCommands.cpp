@@ -8,7 +8,8 @@
 #include <cerrno>
 #include <filesystem>
 #include <initializer_list>
-#include <nlohmann/json.hpp>
+#include <utility>
+#include <variant>
 
 #include "linux/StateDirectory.h"
 #include "os/Files.h"
@@ -21,8 +22,6 @@
 namespace tessel::ctl {
 
 namespace {
-
-using Json = nlohmann::ordered_json;
 
 // The service runs as a user of its own and must be able to read what we write as root.
 constexpr unsigned kReadableByAll = 0644;
@@ -96,14 +95,26 @@ int deferOff(const SwitchOptions& options, const Surroundings& surroundings) {
   return showDeferral(options, false, removed, file);
 }
 
-// The configuration with the new answer. Keys of other owners stay. A file that we cannot read or
-// parse is replaced whole, and its other keys are lost: the switch must work even then.
-std::string changedConfiguration(const std::string& file, bool on) {
-  const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
-  Json configuration = text ? Json::parse(*text, nullptr, false) : Json::object();
-  if (!configuration.is_object()) configuration = Json::object();
-  configuration[kTaskedOnKey] = on;
-  return configuration.dump(2, ' ', false, Json::error_handler_t::replace) + "\n";
+// The configuration with the new answer. Keys of other owners stay as they are. So a file that
+// holds something we do not understand is not replaced: only its owner can tell what would be lost.
+std::variant<std::string, PlatformError> changedConfiguration(const std::string& file, bool on) {
+  auto looked = lookAtConfiguration(file);
+  if (auto* error = std::get_if<PlatformError>(&looked)) return std::move(*error);
+  const auto& found = std::get<ConfigurationFile>(looked);
+  if (found.exists && !found.text) {
+    if (::access(file.c_str(), R_OK) != 0) return fileError(file, errno);
+    return PlatformError{ErrorCode::failed,
+                         file + ": it is no regular file of at most 1 MiB, and stays as it is"};
+  }
+  std::string text = found.text.value_or("");
+  if (text.find_first_not_of(" \t\r\n") == std::string::npos) text = "{}\n";
+  const auto configuration = parseConfiguration(text);
+  if (!configuration ||
+      !std::holds_alternative<ConfigurationValue::Dictionary>(configuration->value))
+    return PlatformError{
+        ErrorCode::failed,
+        file + ": it holds no JSON object, and stays as it is; correct or remove it"};
+  return withMember(text, kTaskedOnKey, on ? "true" : "false");
 }
 
 int showTasking(const SwitchOptions& options, const Surroundings& surroundings) {
@@ -133,7 +144,9 @@ int switchTasking(const SwitchOptions& options, const Surroundings& surroundings
   // The service watches the file and may read it while we write. Half a text is no JSON and gives
   // no answer, so the file is replaced in one step.
   const std::string file = taskingFile(surroundings.launch);
-  if (const auto failure = replaceFileDurably(file, changedConfiguration(file, on), kReadableByAll))
+  const auto changed = changedConfiguration(file, on);
+  if (const auto* refusal = std::get_if<PlatformError>(&changed)) return failToWrite(*refusal);
+  if (const auto failure = replaceFileDurably(file, std::get<std::string>(changed), kReadableByAll))
     return failToWrite(*failure);
   // We show what the rules of the service now decide, not what was asked for: an internal build
   // reports even after "off".

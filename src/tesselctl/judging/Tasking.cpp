@@ -7,8 +7,9 @@
 
 #include <unistd.h>
 
+#include <variant>
+
 #include "linux/SystemFacts.h"
-#include "os/Files.h"
 #include "statora/ConfigurationFiles.h"
 
 namespace tessel::ctl {
@@ -19,22 +20,27 @@ std::string taskingFile(const LaunchConfiguration& launch) {
 
 Tasking askTasking(const LaunchConfiguration& launch) {
   const std::string file = taskingFile(launch);
+  std::string failure;
   OsReleaseBuildVariant variant(launch.osReleasePath);
   const TaskingDecision decision = decideTasking(variant, [&]() -> TaskingDecision {
+    const auto looked = lookAtConfiguration(file);
+    if (const auto* error = std::get_if<PlatformError>(&looked)) {
+      failure = error->words;
+      return {TaskingReason::notLookedAt};
+    }
+    const auto& found = std::get<ConfigurationFile>(looked);
     // The service gets no delivery for an absent file. Its gate waits, then decides as we do here.
-    if (::access(file.c_str(), F_OK) != 0) return {TaskingReason::noneArrived};
-    // The service has the same limit, so a file too large for it is unusable here, too.
-    const auto text = readSmallFile(file, FileConfigurationService::kMaxFileBytes);
-    const auto configuration = text ? parseConfiguration(*text) : nullptr;
+    if (!found.exists) return {TaskingReason::noneArrived};
+    const auto configuration = found.text ? parseConfiguration(*found.text) : nullptr;
     return taskingDecisionForConfiguration(configuration.get(), kTaskingType);
   });
-  return {decision, file};
+  return {decision, failure, file};
 }
 
 std::string_view taskingSourceName(TaskingSource source) {
   // In the order of TaskingSource, which indexes them. Scripts compare these words.
   static constexpr std::string_view kNames[] = {"internal_build", "configuration", "absent",
-                                                "unusable"};
+                                                "unusable", "unknown"};
   return kNames[static_cast<size_t>(source)];
 }
 
@@ -46,6 +52,8 @@ std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& laun
       return tasking.file + " says so";
     case TaskingSource::absent:
       return "there is no " + tasking.file;
+    case TaskingSource::unknown:
+      return "it could not be looked at: " + tasking.failure;
     case TaskingSource::unusable:
       break;
   }

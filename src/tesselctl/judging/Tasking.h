@@ -14,13 +14,14 @@ namespace tessel::ctl {
 
 struct Tasking {
   TaskingDecision decision;
-  std::string file;  // of the configuration, there or not
+  std::string failure;  // why the file could not be looked at; empty if it could
+  std::string file;     // of the configuration, there or not
 };
 
 std::string taskingFile(const LaunchConfiguration& launch);
 Tasking askTasking(const LaunchConfiguration& launch);
 
-// "internal_build", "configuration", "absent", "unusable".
+// "internal_build", "configuration", "absent", "unusable", "unknown".
 std::string_view taskingSourceName(TaskingSource source);
 // Where the answer comes from, in words.
 std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& launch);
