@@ -19,9 +19,11 @@ using namespace tessel;
 // Keeps the last objects and reads them later: their strings must outlive the entry they came from.
 class KeepingSink final : public TraceObjectSink {
  public:
-  bool admits(StringRef subsystem, StringRef category) override {
-    if (!subsystem || !category) std::abort();
-    return true;
+  explicit KeepingSink(Writers& writers)
+      : shares_(writers, {.pairs = 16, .pairBytes = 256, .images = 16, .imageBytes = 256}) {}
+  bool admits(const ObjectOffer& offer) override {
+    if (!offer.subsystem() || !offer.category()) std::abort();
+    return shares_.admits(offer);
   }
   void deliverEvent(std::shared_ptr<const TesselEvent> event) override { keep(std::move(event)); }
   void deliverInterval(std::shared_ptr<const TesselInterval> interval) override {
@@ -38,6 +40,7 @@ class KeepingSink final : public TraceObjectSink {
     if (old && old->name().hash() != (old->name() ? hashText(old->name().text()) : 0)) std::abort();
     old = std::move(object);
   }
+  Shares shares_;
   std::shared_ptr<const TesselObject> kept_[16];
   size_t next_ = 0;
 };
@@ -53,8 +56,9 @@ std::string_view takeLine(std::string_view& rest) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   std::string_view rest(reinterpret_cast<const char*>(data), size);
   TracePointTable table({.fields = 48, .textBytes = size_t{32} << 10});
-  KeepingSink sink;
-  IntervalAssembler assembler(table, sink, {.intervals = 8, .attributes = 12});
+  Writers writers({.users = 2, .programs = 6, .programsOfAUser = 3});
+  KeepingSink sink(writers);
+  IntervalAssembler assembler(table, writers, sink, {.intervals = 8, .attributes = 12});
   EntryHeader header;
   while (!rest.empty()) {
     header.monotonic += static_cast<uint8_t>(rest.front());

@@ -14,7 +14,9 @@ from measure import run_measured
 
 POINTS = int(os.environ.get("TESSEL_HOSTILE_POINTS", "5000" if harness.SANITIZED else "50000"))
 MAX_PAIRS = 4096
+MAX_OF_A_PROGRAM = MAX_PAIRS * 9 // 16  # what all others leave it
 MAX_OPEN_INTERVALS = 65536
+HOSTILE, HONEST = 1000, 1001  # users
 MEMORY = 64 << 10  # KiB that are not pages of files
 ODD = ["\x1b[31mred\x1b[0m\x1b]0;title\x07", "\r\nerror: forged line\n", "%s%n%@%llu%1000000d", "<b>&lt;\"'`$(reboot)",
        "\u202egnp.exe", "\x00nul", "\x7f\x9b31m\x85", "a" * 4096, "..", "/", "{\"TaskedOn\":true}", "'; DROP TABLE events; --",
@@ -27,6 +29,12 @@ def assert_plain(test, text):
     found = TERMINAL.search(text)
     test.assertIsNone(found, found and repr(text[max(0, found.start() - 40):found.end() + 40]))
     test.assertEqual(text, text.encode("utf-8", "replace").decode("utf-8"), "well-formed throughout")
+
+
+def honest(kind, first, category="View{}", **fields):
+    """50 trace points that are reported where their writer gets what is his."""
+    return [point(kind, "com.vantor.Honest", category.format(i), "N", interval=str(i), at=first + i * 0.001, uid=HONEST, **fields)
+            for i in range(50)]
 
 
 class Flood(MachineTest):
@@ -45,20 +53,24 @@ class Flood(MachineTest):
         return dict(self.machine.rows()[-1][1])
 
     def test_each_point_with_a_category_of_its_own(self):
-        entries = (point("event", "com.vantor.Flood", f"Category {i}", "N", telemetry=False, at=-3600 + i * 0.001)
-                   for i in range(POINTS))
-        log = self.run_flood(entries)
-        delivered = min(POINTS, MAX_PAIRS)
+        entries = (point("event", "com.vantor.Flood", f"Category {i}", "N", telemetry=False, at=-3600 + i * 0.001,
+                         uid=HOSTILE, exe="/opt/flood") for i in range(POINTS))
+        log = self.run_flood(itertools.chain(entries, honest("event", -10)))
+        delivered = min(POINTS, MAX_OF_A_PROGRAM)
         statistics = self.statistics()
-        self.assertEqual(statistics["LogObjectsProcessed"], POINTS)
+        self.assertEqual(statistics["LogObjectsProcessed"], POINTS + 50)
         self.assertEqual(statistics["EventsNotReported"], delivered)
+        self.assertEqual(statistics["EventsReported"], 50, "each with a pair of its own")
+        summary = json.loads(self.assert_clean(self.machine.ctl("explain", "--summary", "--json")).out)
+        self.assertEqual(summary["over_share"], [{"uid": HOSTILE, "image": "/opt/flood", "what": "pairs",
+                                                  "count": POINTS - delivered}] if POINTS > delivered else [])
         said = [line for line in log if "too many pairs of subsystem and category" in line]
         self.assertEqual(len(said), 1 if POINTS > delivered else 0)
         if said:
             self.assertIn(f"lost {POINTS - delivered} beyond_pair_limit", said[0])
         # The log lists all pairs; the summary sends the pairs with most objects, and each send waits for its turn.
         self.assertEqual(sum("com.vantor.Flood/Category" in line for line in log), delivered)
-        self.assertEqual(len(self.machine.rows()), 5 + 1)
+        self.assertEqual(len(self.machine.rows()), 2 * 50 + 3 * 5 + 1)
 
     def test_a_category_of_its_own_and_a_long_one(self):
         long = "x" * 4000
@@ -69,14 +81,40 @@ class Flood(MachineTest):
         self.assertTrue(any("too many pairs of subsystem and category" in line for line in log))
 
     def test_intervals_that_never_end(self):
-        entries = (point("begin", "com.vantor.Flood", "Open", f"N{i % 7}", interval=str(i), telemetry=False,
-                         at=-3600 + i * 0.001, attributes=[("key", "v" * 60 + str(i))]) for i in range(2 * POINTS))
-        last = point("end", "com.vantor.Flood", "Open", f"N{(2 * POINTS - 1) % 7}", interval=str(2 * POINTS - 1),
+        count = max(2 * POINTS, MAX_OPEN_INTERVALS + 1000)
+        entries = (point("begin", "com.vantor.Flood", "Open", f"N{i % 7}", interval=str(i), telemetry=False, uid=HOSTILE,
+                         at=-3600 + i * 0.001, attributes=[("key", "v" * 60 + str(i))]) for i in range(count))
+        last = point("end", "com.vantor.Flood", "Open", f"N{(count - 1) % 7}", interval=str(count - 1),
                      telemetry=False, at=-10)
-        log = self.run_flood(itertools.chain(entries, [last]))
+        large = (point("begin", "com.vantor.Flood", "Large", interval=str(i), at=-60 + i * 0.1, uid=HOSTILE + 2,
+                       attributes=[(str(k), f"{i}-{k}-".ljust(4000, "v")) for k in range(32)]) for i in range(100))
+        log = self.run_flood(itertools.chain(honest("begin", -4000), entries, large, [last], honest("end", -5)))
         self.assertEqual(self.statistics()["IntervalsNotReported"], 1, "the youngest is still open")
-        if 2 * POINTS > MAX_OPEN_INTERVALS:
-            self.assertTrue(any("open_interval_dropped: begins that were too many to wait" in line for line in log), log[-5:])
+        self.assertEqual(self.statistics()["IntervalsReported"], 50, "whoever floods us loses his own")
+        self.assertTrue(any("open_interval_dropped: begins that were too many to wait" in line for line in log), log[-5:])
+
+    def test_time_and_programs_run_out(self):
+        """Side by side, because both runs sleep most of the time: junk of one program, then of 29,000."""
+        other = harness.Machine()
+        self.addCleanup(other.close)
+        other.task()
+        other.write_export([point("event", "com.vantor.Flood", "View", "N", at=-3600 + i * 0.001, uid=HOSTILE)
+                            for i in range(2000)] + honest("event", -10, "View"))
+        running = other.start(TESSEL_RUN_LIMIT="24")
+        programs = (point("event", "com.vantor.Flood", "View", "N", at=-3600 + i * 0.001, uid=HOSTILE,
+                          exe=f"/{i}/".ljust(3900, "x")) for i in range(29000))
+        log = self.run_flood(itertools.chain(programs, honest("event", -10, "View")))
+        self.assertTrue(any("beyond_image_limit: too many executables (user 1000, other)" in line for line in log), log[-5:])
+        self.assert_clean(other.result(running))
+        for machine in (self.machine, other):
+            names = [name for name, _ in machine.rows()]
+            self.assertEqual(names.count("ts__com.vantor.Honest__View__N"), 50)
+            with open(os.path.join(machine.state, "last_run.json"), encoding="utf-8") as file:
+                record = json.load(file)
+            self.assertEqual(record["outcome"], "completed")
+        lost = {loss["code"]: loss for loss in record["reading"]["losses"]}["beyond_time_limit"]
+        self.assertEqual((lost["uid"], lost["count"]), (HOSTILE, 2000 - names.count("ts__com.vantor.Flood__View__N")))
+        self.assertAlmostEqual(lost["count"], 2000 - 24 * 9 / 16 / 0.025, delta=20)
 
     def test_every_value_is_new_and_as_long_as_may_be(self):
         count = POINTS // 10

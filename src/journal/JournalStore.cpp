@@ -108,6 +108,7 @@ struct JournalStore::State final : EntryStream {
         ServiceStatus* serviceStatus)
       : range(timeRange), stop(stopFlag), status(serviceStatus), tokenizer(user), merger(stopFlag) {
     facts.reading.rangeStart = range.start;
+    facts.reading.rangeEnd = range.end;
   }
 
   bool next() override;

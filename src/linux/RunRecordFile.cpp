@@ -21,9 +21,9 @@ namespace {
 using Json = nlohmann::ordered_json;
 
 constexpr size_t kMaxFailureBytes = 1024;
-// Losses of three codes (skipped files, damage, dropped entries) vary without bound, so each of
-// these codes may list 17. JSON escapes double a text at most. So 51 losses with two such texts
-// each take 60 KiB with their keys.
+// Losses of three codes (skipped files, damage, dropped entries) and of the five codes of writers
+// over their share vary without bound, so each of these codes may list 17. JSON escapes double a
+// text at most. So 51 losses with two such texts each and 85 with one take 120 KiB with their keys.
 constexpr size_t kMaxTextBytes = 256;
 
 Date dateAt(const Json& json, const char* key) {
@@ -52,6 +52,7 @@ Loss lossFrom(const Json& json) {
             {json.at("place").get<std::string>(), {}},
             countAt(json, "places")};
   if (json.contains("offset")) loss.place.offset = countAt(json, "offset");
+  if (json.contains("uid")) loss.place.user = json.at("uid").get<uint32_t>();
   return loss;
 }
 
@@ -62,13 +63,16 @@ void addLoss(JsonWriter& json, const Loss& loss) {
   json.member("code", lossName(loss.code)).member("count", loss.count);
   json.member("words", shortPlainText(loss.words, kMaxTextBytes));
   json.member("place", shortPlainText(loss.place.name, kMaxTextBytes));
-  json.member("offset", loss.place.offset).member("places", loss.places);
+  json.member("offset", loss.place.offset).member("uid", loss.place.user);
+  json.member("places", loss.places);
 }
 
 void addReading(JsonWriter& json, const StoreReading& reading) {
   json.member("entries_read", reading.entriesRead);
   json.member("duplicates", reading.duplicateEntries);
   json.member("oldest", reading.oldestEntry).member("range_start", reading.rangeStart);
+  json.member("last_entry", reading.lastEntry).member("range_end", reading.rangeEnd);
+  json.member("stopped", reading.stopped);
   json.member("sequence_gaps", reading.sequenceGaps);
   json.member("files_read", reading.filesRead);
   json.member("files_outside_range", reading.filesOutsideRange);
@@ -85,6 +89,10 @@ StoreReading readingFrom(const Json& json) {
   reading.filesRead = countAt(json, "files_read");
   reading.filesOutsideRange = countAt(json, "files_outside_range");
   if (json.contains("oldest")) reading.oldestEntry = countAt(json, "oldest");
+  if (json.contains("last_entry")) reading.lastEntry = countAt(json, "last_entry");
+  // An older service says neither how far the reading came nor where the period ended.
+  if (json.contains("range_end")) reading.rangeEnd = countAt(json, "range_end");
+  if (json.contains("stopped")) reading.stopped = json.at("stopped").get<bool>();
   // The list bounds itself, so a record that names more losses than we write cannot fill it.
   for (const Json& loss : json.at("losses")) reading.losses.add(lossFrom(loss));
   return reading;
@@ -106,6 +114,7 @@ RunRecord recordFrom(const Json& json) {
   record.inspected = countAt(json, "inspected");
   record.classified = json.at("classified").get<ClassifiedCounts>();
   record.unnamed = countAt(json, "unnamed");
+  if (json.contains("unsendable")) record.unsendable = countAt(json, "unsendable");
   record.countEvents = countAt(json, "count_events");
   if (hasReading(json)) record.reading = readingFrom(json.at("reading"));
   record.rowsStored = countAt(json, "rows_stored");
@@ -134,7 +143,8 @@ std::optional<PlatformError> writeRunRecord(const RunRecord& record,
     json.member("failure", shortPlainText(record.failure, kMaxFailureBytes));
     json.member("log_events", record.logEvents).member("inspected", record.inspected);
     json.array("classified", record.classified, [&](uint64_t count) { json.value(count); });
-    json.member("unnamed", record.unnamed).member("count_events", record.countEvents);
+    json.member("unnamed", record.unnamed).member("unsendable", record.unsendable);
+    json.member("count_events", record.countEvents);
     if (record.reading) json.object("reading", [&] { addReading(json, *record.reading); });
     json.member("rows_stored", record.rowsStored);
     json.object("rows_failed", [&] {

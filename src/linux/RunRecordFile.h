@@ -15,7 +15,7 @@ namespace tessel {
 
 std::string runRecordPath(const std::string& stateDirectory);
 
-// Our records have a sixteenth of this at most, so a larger one of a later service can still be
+// Our records have an eighth of this at most, so a larger one of a later service can still be
 // read. The bound keeps a file that somebody else put there from filling the memory.
 inline constexpr size_t kMaxRunRecordBytes = size_t{1} << 20;
 

@@ -28,7 +28,7 @@ namespace tessel {
 
 enum class RunOutcome : uint8_t {
   completed,    // the whole period was read
-  interrupted,  // a deferral was asked for during the run; the reading may have ended early
+  interrupted,  // a stop ended the reading early
   bailedOut,    // the run found the marker of a run that had died, and read nothing
   failed,       // the marker could not be made, or the trace store could not be read
   notTasked,    // this machine was not to report; such a run leaves no record
@@ -51,6 +51,7 @@ struct RunRecord {
   uint64_t inspected = 0;  // trace objects
   ClassifiedCounts classified{};
   uint64_t unnamed = 0;      // reported objects without a full name: one event each, not two
+  uint64_t unsendable = 0;   // reported objects of which no payload could be made: no event
   uint64_t countEvents = 0;  // handed to the spool, stored or not
   // Absent if nothing was read, or if the file has the reading in a form that we do not know.
   std::optional<StoreReading> reading;
@@ -70,8 +71,10 @@ struct RunRecord {
     return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
   }
   // Rows that the run should have stored. A reported object makes two, or one if it lacks a full
-  // name. Each count event makes one, and so does the summary.
-  uint64_t rowsExpected() const { return 2 * reported() - unnamed + countEvents + 1; }
+  // name, or none if it has no payload. Each count event makes one, and so does the summary.
+  uint64_t rowsExpected() const {
+    return 2 * (reported() - unsendable) - unnamed + countEvents + 1;
+  }
   bool rowsBalance() const { return rowsStored == rowsExpected(); }
 
   bool operator==(const RunRecord&) const = default;

@@ -9,10 +9,6 @@
 
 namespace tessel {
 
-namespace {
-constexpr uint32_t eventsPerQuantum = 10;
-}
-
 void Throttle::setUp() {
   const Timebase timebase = clock_.timebase();
   // The first step calls this, and not the constructor, so that the first quantum begins with the
@@ -22,19 +18,21 @@ void Throttle::setUp() {
   quantumMicroseconds_ = 125000.0f;
   const double quantum = static_cast<double>(quantumMicroseconds_);
   tesselReporterLog().debug("%f us, %f mach time units per quantum of %u reported events", quantum,
-                            quantum / microsecondsPerMachUnit_, eventsPerQuantum);
+                            quantum / microsecondsPerMachUnit_, kStepsPerQuantum);
   quantumStartTime_ = clock_.continuousTicks();
 }
 
 void Throttle::throttleReportedEvent() {
   std::call_once(firstUse_, [this] { setUp(); });
   ++eventsInQuantum_;
-  if (eventsInQuantum_ < eventsPerQuantum) return;
-  const uint64_t ticks = clock_.continuousTicks() - quantumStartTime_;
-  sleepForRestOfQuantum(static_cast<double>(ticks) * microsecondsPerMachUnit_);
+  if (eventsInQuantum_ < kStepsPerQuantum) return;
+  const uint64_t now = clock_.continuousTicks();
+  sleepForRestOfQuantum(static_cast<double>(now - quantumStartTime_) * microsecondsPerMachUnit_);
   eventsInQuantum_ = 0;
+  ++quantaClosed_;
   // Read after the sleep, so that the sleep does not count for the next quantum.
   quantumStartTime_ = clock_.continuousTicks();
+  sleptTicks_ += quantumStartTime_ - now;
 }
 
 void Throttle::sleepForRestOfQuantum(double elapsedMicroseconds) {

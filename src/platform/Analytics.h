@@ -2,6 +2,7 @@
 
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -66,22 +67,32 @@ class ConfigurationService {
 //
 // Take a step before every send. Each tenth step closes a quantum and sleeps for what is left of
 // its 125,000 microseconds. The other nine cost an increment and a comparison.
+// So one step stands for 12,500 microseconds of a run, whichever step it is that sleeps.
 //
 // One object serves the whole process, and its counters go on from run to run. It has no lock, so
 // only one thread at a time may use it.
 class Throttle {
  public:
+  static constexpr std::chrono::microseconds kTimeOfAStep{12'500};
+
   explicit Throttle(Clock& clock) : clock_(clock) {}
 
   // Takes one step. Sleeps on the caller's thread if the sends go too fast.
   void throttleReportedEvent();
 
+  // Steps so far.
+  uint64_t stepCount() const { return quantaClosed_ * kStepsPerQuantum + eventsInQuantum_; }
+  // Ticks of the clock that steps have spent sleeping so far, by the clock itself: a sleep may take
+  // longer than it was asked to.
+  uint64_t sleptTicks() const { return sleptTicks_; }
   // Number of sleeps so far.
   uint64_t throttledCount() const { return throttledCount_; }
   // Microseconds slept so far.
   uint64_t throttledMicroseconds() const { return throttledMicroseconds_; }
 
  private:
+  static constexpr uint32_t kStepsPerQuantum = 10;
+
   void setUp();
   void sleepForRestOfQuantum(double elapsedMicroseconds);
 
@@ -91,6 +102,8 @@ class Throttle {
   float quantumMicroseconds_ = 0;
   uint64_t eventsInQuantum_ = 0;
   uint64_t quantumStartTime_ = 0;
+  uint64_t quantaClosed_ = 0;
+  uint64_t sleptTicks_ = 0;
   uint64_t throttledCount_ = 0;
   uint64_t throttledMicroseconds_ = 0;
 };

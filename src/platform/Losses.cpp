@@ -1,7 +1,7 @@
 // The names of losses, and the list of them.
 //
 // The list is short, so it is searched from one end to the other. A usual day has fewer than ten
-// losses. The most are nine codes with 17 losses each: 16 and the "other" one.
+// losses. The most are twelve codes with 17 losses each: 16 and the "other" one.
 
 #include "platform/Losses.h"
 
@@ -18,9 +18,9 @@ constexpr std::string_view kOther = "other";
 
 // These names stand in the records of runs and in what programs read, so none is ever changed.
 constexpr std::array<std::string_view, kLossCodes> kNames = {
-    "file_skipped",    "files_not_looked_at",   "file_damaged",
-    "entries_missing", "dropped_by_daemon",     "no_image_path",
-    "malformed",       "open_interval_dropped", "beyond_pair_limit"};
+    "file_skipped",      "files_not_looked_at", "file_damaged",      "entries_missing",
+    "dropped_by_daemon", "no_image_path",       "malformed",         "open_interval_dropped",
+    "beyond_pair_limit", "beyond_image_limit",  "beyond_text_limit", "beyond_time_limit"};
 
 // A failing disk damages many files in the same way. The kind of damage then says more than the
 // list of files, so damage is summed over all files. Losses of the other codes stay apart by place.
@@ -28,7 +28,7 @@ bool sumsPlaces(LossCode code) { return code == LossCode::fileDamaged; }
 
 bool isSame(const Loss& a, const Loss& b) {
   return a.code == b.code && a.words == b.words &&
-         (sumsPlaces(a.code) || a.place.name == b.place.name);
+         (sumsPlaces(a.code) || (a.place.name == b.place.name && a.place.user == b.place.user));
 }
 
 }  // namespace
@@ -44,6 +44,10 @@ std::optional<LossCode> lossNamed(std::string_view name) {
 // The offset is that of the first place: whoever looks into a damaged file begins there.
 std::string Loss::where() const {
   std::string where = place.name;
+  if (isOverShare(code) && !where.empty()) {
+    // A writer is a user first: anyone can give a program any path.
+    where = (place.user ? "user " + std::to_string(*place.user) : "unknown user") + ", " + where;
+  }
   if (place.offset) where += (where.empty() ? "byte " : ", byte ") + std::to_string(*place.offset);
   if (places > 1) where += ", and " + std::to_string(places - 1) + " more";
   return where;
@@ -87,6 +91,13 @@ void Losses::add(LossCode code, std::string_view words, const LossPlace& place, 
 
 void Losses::add(const Losses& others) {
   for (const Loss& loss : others.losses_) add(loss);
+}
+
+// Entries come nearly in the order of their times, and one may even be of before the period. So the
+// last one says how far the reading came, within the period.
+uint64_t StoreReading::unread() const {
+  if (!stopped) return 0;
+  return rangeEnd - std::clamp(lastEntry.value_or(rangeStart), rangeStart, rangeEnd);
 }
 
 uint64_t Losses::notListed(LossCode code) const {

@@ -23,17 +23,27 @@ namespace tessel {
 
 // In the order in which losses are shown.
 enum class LossCode : uint8_t {
-  fileSkipped,          // files that were not read; the place is the path
-  filesNotLookedAt,     // files beyond the limit on their number
-  fileDamaged,          // damaged spots in files; the place is the first file and its byte
-  entriesMissing,       // sequence numbers that no entry has
-  droppedByDaemon,      // entries that the journal daemon dropped; the place is the unit
-  noImagePath,          // trace points whose executable is not known
-  malformed,            // entries with the mark of a trace point but bad fields
+  fileSkipped,       // files that were not read; the place is the path
+  filesNotLookedAt,  // files beyond the limit on their number
+  fileDamaged,       // damaged spots in files; the place is the first file and its byte
+  entriesMissing,    // sequence numbers that no entry has
+  droppedByDaemon,   // entries that the journal daemon dropped; the place is the unit
+  noImagePath,       // trace points whose executable is not known
+  malformed,         // entries with the mark of a trace point but bad fields
+  // From here on each loss belongs to the writer who had more than his share. Its place is his
+  // executable, and his user.
   openIntervalDropped,  // begins that were dropped to make room for younger ones
   beyondPairLimit,      // objects whose pair of subsystem and category was not kept
+  beyondImageLimit,     // objects of an executable that was not kept
+  beyondTextLimit,      // objects for whose rows the spool had no room left
+  beyondTimeLimit,      // objects for which the run had no time left
 };
-inline constexpr size_t kLossCodes = 9;
+inline constexpr size_t kLossCodes = 12;
+
+// Whether losses of the code belong to a writer who had more than his share.
+constexpr bool isOverShare(LossCode code) {
+  return code >= LossCode::openIntervalDropped && code <= LossCode::beyondTimeLimit;
+}
 
 // The name in JSON and in the documentation, such as "file_skipped".
 std::string_view lossName(LossCode code);
@@ -41,8 +51,9 @@ std::string_view lossName(LossCode code);
 std::optional<LossCode> lossNamed(std::string_view name);
 
 struct LossPlace {
-  std::string name;                // of a file or a unit; empty if there is none
-  std::optional<uint64_t> offset;  // bytes from the start of that file
+  std::string name;                   // of a file, a unit or an executable; empty if there is none
+  std::optional<uint64_t> offset;     // bytes from the start of that file
+  std::optional<uint32_t> user = {};  // of a writer over his share; absent if nobody knows it
 
   bool operator==(const LossPlace&) const = default;
 };
@@ -105,7 +116,12 @@ struct StoreReading {
   uint64_t filesRead = 0;
   uint64_t filesOutsideRange = 0;  // not read, because all their entries are of another period
   Losses losses;
+  bool stopped = false;                    // before the end of the period was reached
+  uint64_t rangeEnd = 0;                   // microseconds since 1970
+  std::optional<uint64_t> lastEntry = {};  // the last that was read, in microseconds since 1970
 
+  // The end of the period that a stop left unread, in microseconds. 0 if everything was read.
+  uint64_t unread() const;
   // Whether the store reaches back to the start of the period.
   bool reachesRangeStart() const { return oldestEntry && *oldestEntry <= rangeStart; }
   bool operator==(const StoreReading&) const = default;

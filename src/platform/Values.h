@@ -134,6 +134,8 @@ class StringPool {
   // The same, with a number that the pool keeps beside each string for its user. It begins as 0.
   Noted internNoted(std::string_view text);
   size_t size() const { return strings_.size(); }
+  // Bytes held by the texts and their records alone.
+  size_t textBytes() const { return textBytes_; }
   // Bytes held by the texts, their records and the bookkeeping of both.
   size_t memoryUsed() const {
     return textBytes_ + strings_.capacity() * sizeof(Kept) + index_.memoryUsed();

@@ -31,12 +31,16 @@ TEST(LossesTest, SumsEqualOnesAndDamageOverAllFiles) {
     losses.add(LossCode::fileSkipped, "Permission denied", {path, {}});
   }
   losses.add(LossCode::droppedByDaemon, "over the rate limit", {"x.service", {}}, 0);
+  for (const auto& user : {std::optional<uint32_t>(), std::optional<uint32_t>(7)})
+    losses.add(LossCode::beyondPairLimit, "too many", {"/opt/a", {}, user}, 2);
   EXPECT_THAT(described(losses),
               ElementsAre("1 file_skipped: Permission denied (/a)",
                           "1 file_skipped: Permission denied (/b)",
                           "1 file_skipped: Permission denied (/c)",
                           "12 file_damaged: entry damaged (/a, byte 8, and 2 more)",
-                          "2 malformed: missing TESSEL_KIND"));
+                          "2 malformed: missing TESSEL_KIND",
+                          "2 beyond_pair_limit: too many (unknown user, /opt/a)",
+                          "2 beyond_pair_limit: too many (user 7, /opt/a)"));
 }
 
 TEST(LossesTest, CountsWhatHasNoRoomUnderOther) {

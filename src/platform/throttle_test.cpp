@@ -49,7 +49,9 @@ TEST_F(ThrottleTest, ALongQuantumEndsWithoutSleep) {
 
 TEST_F(ThrottleTest, TheNewQuantumStartsAfterTheSleep) {
   steps(10);
-  steps(10);
+  steps(11);
+  EXPECT_EQ(throttle.stepCount(), 21u);
+  EXPECT_EQ(throttle.sleptTicks(), 250'000'000u);
   EXPECT_EQ(clock.sleeps, (std::vector<uint32_t>{125'000, 125'000}));
   EXPECT_EQ(throttle.throttledCount(), 2u);
   EXPECT_EQ(throttle.throttledMicroseconds(), 250'000u);

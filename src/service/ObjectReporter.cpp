@@ -15,6 +15,8 @@ namespace tessel {
 
 namespace {
 
+constexpr std::string_view kFixedEventName = "com.vantor.performance.tessel";
+
 // The name of the second event has three parts. If one were left empty, different kinds of objects
 // could share an event name, so an object without all three has no second event.
 bool hasEventName(const TesselObject& object) {
@@ -58,11 +60,16 @@ std::optional<Payload> reportPayload(const TesselObject& object, ProcessIdentity
 
 void EventRoad::send(const std::shared_ptr<const TesselObject>& object,
                      const std::shared_ptr<const Payload>& payload) {
+  // We measure the rows here and not where they are stored: only this thread knows whose they are.
+  // A run makes at most 40 objects a second into rows, so the text that is thrown away costs
+  // nothing.
+  const size_t bytes = payloadJson(*payload).size();
+  queuedBytes_ += bytes + kFixedEventName.size();
+  if (hasEventName(*object)) queuedBytes_ += bytes + eventName(*object).size();
   // The throttle sleeps on this thread, which is the one that delivers objects. The extractor
   // therefore slows down to the pace of the sends. If the queue slept instead, it would fill up.
   throttle_.throttleReportedEvent();
-  reportingQueue_.async(
-      [this, payload] { sender_.sendEvent("com.vantor.performance.tessel", *payload); });
+  reportingQueue_.async([this, payload] { sender_.sendEvent(kFixedEventName, *payload); });
   // An object without a second event takes this step, too. The pace of a run therefore only depends
   // on the number of reported objects.
   throttle_.throttleReportedEvent();
@@ -77,12 +84,15 @@ bool ObjectReporter::reportTesselObject(const std::shared_ptr<const TesselObject
   if (!payload) {
     tesselReporterLog().debug("Failed to create payload for %@/%@%@", object->subsystem(),
                               object->category(), object->name());
+    ++unsendableCount_;
     return true;
   }
   if (!hasEventName(*object)) ++unnamedCount_;
-  // The run's record expects two rows for each reported object, less one for each unnamed object.
-  // More unnamed than reported objects would make that number meaningless.
-  TESSEL_INVARIANT(unnamedCount_ <= filter_->telemetryReportedAggregation().totalCount());
+  // The run's record expects two rows for each reported object, less one for each unnamed object
+  // and two for each unsendable one. More of these than reported objects would make that number
+  // meaningless.
+  TESSEL_INVARIANT(unnamedCount_ + unsendableCount_ <=
+                   filter_->telemetryReportedAggregation().totalCount());
   road_.send(object, std::make_shared<const Payload>(*std::move(payload)));
   return true;
 }

@@ -38,6 +38,9 @@ class EventRoad {
   EventRoad(Throttle& throttle, EventSender& sender, SerialQueue& reportingQueue)
       : throttle_(throttle), sender_(sender), reportingQueue_(reportingQueue) {}
 
+  // Bytes of all rows queued so far, names included.
+  uint64_t queuedBytes() const { return queuedBytes_; }
+
   // Queues two events with the same payload. The first has the name that all objects share. The
   // second is named after the object; an object without subsystem, category or name has no second.
   // Sleeps if the sends come too fast. The queued jobs keep the object and the payload alive.
@@ -48,6 +51,7 @@ class EventRoad {
   Throttle& throttle_;
   EventSender& sender_;
   SerialQueue& reportingQueue_;
+  uint64_t queuedBytes_ = 0;
 };
 
 // Reports the objects of one run. The three callbacks of the extractor share it.
@@ -69,6 +73,8 @@ class ObjectReporter {
   const TesselReporterObjectFilter& filter() const { return *filter_; }
   // Reported objects that lack subsystem, category or name. They send one event instead of two.
   uint64_t unnamedCount() const { return unnamedCount_; }
+  // Reported objects of which no payload could be made. They send no event.
+  uint64_t unsendableCount() const { return unsendableCount_; }
 
  private:
   const std::shared_ptr<TesselReporterObjectFilter> filter_;
@@ -76,6 +82,7 @@ class ObjectReporter {
   ProcessIdentity& identity_;
   EventRoad& road_;
   uint64_t unnamedCount_ = 0;
+  uint64_t unsendableCount_ = 0;
 };
 
 }  // namespace tessel

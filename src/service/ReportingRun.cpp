@@ -125,11 +125,14 @@ RunRecord TraceReading::report(const std::shared_ptr<Activity>& activity) {
     record.countEvents = summary_.reportRunSummary(filter, record.logEvents, startDate, endDate,
                                                    *interrupted, startTime);
   });
-  // A deferral may still come during the summary, so we look after it. The run then counts as
-  // interrupted, even if it had read everything. A failure is the weightier outcome and stays.
-  if (!failure && *interrupted) record.outcome = RunOutcome::interrupted;
+  // The reading itself knows whether it came to its end. A deferral that comes later sets the flag,
+  // and the closing line says so, but it cost nothing. A failure is the weightier outcome and
+  // stays.
   record.reading = extractor->reading();
+  const bool cutShort = record.reading ? record.reading->stopped : interrupted->load();
+  if (!failure && cutShort) record.outcome = RunOutcome::interrupted;
   record.unnamed = reporter->unnamedCount();
+  record.unsendable = reporter->unsendableCount();
   record.inspected = filter.allInspectedTesselObjectsAggregation().totalCount();
   record.classified = filter.classifiedCounts();
   // Each inspected object was either reported or held back, and for exactly one reason.

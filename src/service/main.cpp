@@ -36,6 +36,9 @@ T& keep(Args&&... args) {
   return *kept.emplace_back(new T(std::forward<Args>(args)...));
 }
 
+// What one run may send, so that a flood of one day leaves room for a week.
+constexpr uint64_t kRunsInASpool = 8;
+
 [[noreturn]] void refuse(int status, const std::string& line) {
   std::fprintf(stderr, "tessel_reporter: %s\n", line.c_str());
   std::exit(status);
@@ -99,11 +102,20 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
   auto& volumes = keep<MountTable>();
   auto& identity = keep<ProcessIdentity>(keep<AppBundles>(volumes));
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
-  const auto makeExtractor = [store = launch.traceStore, &status] {
+  ExtractionLimits limits;
+  limits.shares.rowBytes = launch.spoolLimitBytes / kRunsInASpool;
+  if (launch.runLimit.count() != 0)
+    limits.shares.nanoseconds =
+        static_cast<uint64_t>(std::chrono::nanoseconds(launch.runLimit).count());
+  const auto makeExtractor = [store = launch.traceStore, limits, &status, &throttle, &road,
+                              &clock] {
     // The poll of a past run keeps a weak reference. make_shared() puts the object and its counter
     // into one block, so a weak reference would keep the memory of the whole extractor.
-    std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store));
+    std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store, limits));
     extractor->reportProgressTo(status);
+    extractor->chargeBy(clock, [&throttle, &road] {
+      return Spending{throttle.stepCount(), throttle.sleptTicks(), road.queuedBytes()};
+    });
     return extractor;
   };
   const auto makeReporter = [&variant, &volumes, &identity, &road] {

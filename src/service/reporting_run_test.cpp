@@ -111,6 +111,9 @@ TEST_F(RunTest, AnObjectIsTwoEventsAndANamelessOneOne) {
     EXPECT_EQ(names[i + 1], "ts__com.vantor.Calendar__View__Open");
     EXPECT_EQ(sender.events[i].json, sender.events[i + 1].json);
   }
+  size_t bytes = 0;
+  for (size_t i = 0; i < 7; ++i) bytes += names[i].size() + sender.events[i].json.size();
+  EXPECT_EQ(road.queuedBytes(), bytes);
   EXPECT_EQ(names[6], "com.vantor.performance.tessel");
   EXPECT_EQ(names[7], "com.vantor.performance.tessel_counts");
   EXPECT_EQ(records.at(0).unnamed, 1u);
@@ -216,6 +219,8 @@ TEST_F(RunTest, AnObjectWithoutPayloadIsCountedAndNotSent) {
   EXPECT_EQ(filter->telemetryReportedAggregation().totalCount(), 10u);
   EXPECT_EQ(throttle.throttledCount(), 0u);
   EXPECT_EQ(reportingQueue.pending(), 0u);
+  EXPECT_EQ(reporter.unsendableCount(), 10u);
+  EXPECT_EQ(road.queuedBytes(), 0u);
 }
 
 TEST_F(RunTest, ADeferralStopsTheExtraction) {
@@ -237,6 +242,13 @@ TEST_F(RunTest, ADeferralStopsTheExtraction) {
   EXPECT_EQ(timer->interval, std::chrono::seconds{10});
   EXPECT_EQ(timer->leeway, std::chrono::seconds{10});
   EXPECT_EQ(timer->queue->label(), "tessel_reporter defer polling queue");
+  // The reading itself knows whether the deferral cut it short.
+  for (const bool stopped : {true, false}) {
+    extractor->found.emplace().stopped = stopped;
+    perform();
+    EXPECT_NE(sender.events.back().json.find("\"WasInterrupted\":true"), std::string::npos);
+    EXPECT_EQ(records.back().outcome, stopped ? RunOutcome::interrupted : RunOutcome::completed);
+  }
 }
 
 TEST_F(RunTest, ThePollOutlivesTheRunNotItsExtractor) {

@@ -8,10 +8,6 @@ namespace tessel {
 
 namespace {
 
-FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
-  return tokens[static_cast<size_t>(kind)];
-}
-
 // labelled() counts kinds two by two, so FieldKind must have a label and a value for each labelled
 // argument of an object.
 static_assert(labelled(FieldKind::string1Name, kLabelledStrings) == FieldKind::number1Name &&
@@ -28,17 +24,15 @@ void addLosses(const AssemblyCounts& counts, Losses& losses) {
     losses.add(LossCode::malformed, malformedReasonText(static_cast<MalformedReason>(reason)), {},
                counts.malformed[reason]);
   }
-  losses.add(LossCode::openIntervalDropped, "begins that were too many to wait", {},
-             counts.droppedOpenIntervals);
 }
 
-IntervalAssembler::IntervalAssembler(TracePointTable& table, TraceObjectSink& sink,
-                                     OpenIntervalLimits limits)
-    : table_(table), sink_(sink), open_(limits) {}
+IntervalAssembler::IntervalAssembler(TracePointTable& table, Writers& writers,
+                                     TraceObjectSink& sink, OpenIntervalLimits limits)
+    : table_(table), writers_(writers), sink_(sink), open_(writers, limits) {}
 
 AssemblyCounts IntervalAssembler::counts() const {
   AssemblyCounts counts = counts_;
-  counts.droppedOpenIntervals = open_.dropped();
+  counts.droppedOpenIntervals = writers_.lostOf(LossCode::openIntervalDropped);
   counts.openIntervals = open_.size();
   return counts;
 }
@@ -81,22 +75,41 @@ bool IntervalAssembler::meansToBeATracePoint(std::span<const FieldToken> tokens)
   });
 }
 
-// If an entry has a field more than once, the last value counts. All entries share the buffers of
-// point_, so most entries allocate nothing.
+// All entries share the buffers of point_, so most entries allocate nothing.
 void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   point_.tokens.fill(kNoToken);
   point_.attributes.clear();
   point_.malformed = kNoToken;
+  FieldToken repeated = kNoToken;
   for (const FieldToken token : tokens) {
     const FieldKind kind = TracePointTable::kind(token);
     if (kind < FieldKind::attribute) [[likely]] {
-      point_.tokens[static_cast<size_t>(kind)] = token;
+      FieldToken& slot = point_.tokens[static_cast<size_t>(kind)];
+      repeated |= slot;
+      slot = token;
     } else if (kind == FieldKind::attribute) {
       point_.attributes.push_back(token);
     } else if (kind == FieldKind::malformed) {
-      point_.malformed = token;
+      point_.malformed = lesserFault(point_.malformed, token);
     }
   }
+  if (repeated != kNoToken) [[unlikely]]
+    readRepeated(tokens);
+}
+
+// A journal sorts the fields of an entry, so which of several values came first cannot be known.
+// The greatest counts, so that each kind of file gives the same object.
+void IntervalAssembler::readRepeated(std::span<const FieldToken> tokens) {
+  for (const FieldToken token : tokens) {
+    const FieldKind kind = TracePointTable::kind(token);
+    if (kind >= FieldKind::attribute) continue;
+    FieldToken& slot = point_.tokens[static_cast<size_t>(kind)];
+    if (table_.isGreater(token, slot)) slot = token;
+  }
+}
+
+FieldToken IntervalAssembler::lesserFault(FieldToken a, FieldToken b) const {
+  return a == kNoToken || table_.malformedReason(b) < table_.malformedReason(a) ? b : a;
 }
 
 // An entry with several faults counts under one reason only. So the sum over all reasons is the
@@ -112,10 +125,7 @@ std::optional<MalformedReason> IntervalAssembler::fault() const {
 
 void IntervalAssembler::emitEvent() {
   ++counts_.events;
-  if (!sink_.admits(table_.text(point_[FieldKind::subsystem]),
-                    table_.text(point_[FieldKind::category]))) {
-    return;
-  }
+  if (!sink_.admits({table_, point_.tokens, point_.tokens})) return;
   // An event lasts no time unless it states a duration.
   sink_.deliverEvent(
       std::make_shared<const TesselEvent>(fieldsOf(point_.tokens, 0), processOf(point_.tokens)));
@@ -123,8 +133,21 @@ void IntervalAssembler::emitEvent() {
 
 void IntervalAssembler::begin(const EntryHeader& header) {
   const bool replaced =
-      open_.open(keyOf(header), header.monotonic, point_.tokens, point_.attributes);
+      open_.open(keyOf(header), writerNumber(), header.monotonic, point_.tokens, point_.attributes);
   if (replaced) ++counts_.replacedBegins;
+}
+
+// Few writers make nearly all begins. A comparison of tokens costs a third of reading their values.
+uint32_t IntervalAssembler::writerNumber() {
+  const FieldToken image = point_[FieldKind::imagePath];
+  RecentWriter& recent = recentWriters_[image % kRecentWriters];
+  const RecentWriter wanted{image, point_[FieldKind::user], point_[FieldKind::sessionOwner],
+                            recent.number};
+  if (recent != wanted || recent.number == FlatIndex::kNone) [[unlikely]] {
+    recent = wanted;
+    recent.number = writers_.numberOf(writer());
+  }
+  return recent.number;
 }
 
 void IntervalAssembler::end(const EntryHeader& header) {
@@ -139,9 +162,8 @@ void IntervalAssembler::end(const EntryHeader& header) {
   // because the filter counts such intervals.
   const auto microseconds = static_cast<int64_t>(header.monotonic - begin->monotonic);
   const auto seconds = static_cast<float>(static_cast<double>(microseconds) / 1e6);
-  if (sink_.admits(table_.text(begin->key.subsystem), table_.text(begin->key.category))) {
+  if (sink_.admits({table_, begin->tokens, point_.tokens}))
     deliverMerged(begin->tokens, begin->attributes, seconds);
-  }
   open_.close(begin);
 }
 
@@ -214,16 +236,23 @@ EmittingProcess IntervalAssembler::processOf(const PointTokens& tokens) const {
           table_.text(tokenOf(tokens, FieldKind::processName))};
 }
 
-// Adds the attributes whose key the interval does not have yet. All keys come from one pool, so
+// Adds the attributes of one entry. An attribute that the interval has from the other entry stays.
+// Of several with one key in this entry, the greatest value counts. All keys come from one pool, so
 // equal keys have the same record. An entry has at most 32 attributes, so a linear search is quick.
 void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
                                          IntervalFields& interval) const {
+  const size_t fromOther = interval.attributes.size();
   for (const FieldToken token : tokens) {
     const auto& attribute = table_.attribute(token);
-    const bool known = std::any_of(
+    const auto known = std::find_if(
         interval.attributes.begin(), interval.attributes.end(),
         [&](const auto& other) { return other.first.record() == attribute.first.record(); });
-    if (!known) interval.attributes.push_back(attribute);
+    if (known == interval.attributes.end()) {
+      interval.attributes.push_back(attribute);
+    } else if (static_cast<size_t>(known - interval.attributes.begin()) >= fromOther &&
+               known->second.text() < attribute.second.text()) {
+      known->second = attribute.second;
+    }
   }
 }
 
@@ -231,8 +260,10 @@ void IntervalAssembler::appendAttributes(const std::vector<FieldToken>& tokens,
 // tokens in the new generation too, so two different keys never become equal.
 void IntervalAssembler::startGeneration() {
   TracePointTable::Renewal renewal = table_.startGeneration();
-  open_.renewAll([&](OpenInterval& interval) {
-    if (!renewal.hasRoom()) return false;
+  recentWriters_.fill(RecentWriter{});
+  open_.renewAll([&](OpenInterval& interval) -> std::optional<size_t> {
+    if (!renewal.hasRoom()) return std::nullopt;
+    const size_t before = table_.bytes();
     for (FieldToken& token : interval.tokens) token = renewal.renewed(token);
     for (FieldToken& token : interval.attributes) token = renewal.renewed(token);
     const auto token = [&](FieldKind kind) { return tokenOf(interval.tokens, kind); };
@@ -243,7 +274,7 @@ void IntervalAssembler::startGeneration() {
     key.name = token(FieldKind::name);
     key.id = table_.identity(token(FieldKind::intervalId));
     if (key.process != IntervalKey::kSystemScope) key.process = token(FieldKind::process);
-    return true;
+    return table_.bytes() - before;
   });
 }
 

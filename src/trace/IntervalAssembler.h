@@ -5,7 +5,8 @@
 // process must be equal too. A second begin with the same key replaces the first. An end without a
 // begin is counted and delivers nothing. If the end lacks a field, the interval takes it from the
 // begin. Telemetry is on if the begin or the end says so. An interval is an animation interval if
-// its begin or its end has a frame rate.
+// its begin or its end has a frame rate. If an entry states a field more than once, the greatest
+// value counts, because the journal does not keep the order in which a writer states fields.
 //
 // This class compares tokens and never reads text. The objects borrow the strings of the table.
 //
@@ -20,6 +21,7 @@
 #include "objects/TesselObject.h"
 #include "platform/Losses.h"
 #include "trace/OpenIntervals.h"
+#include "trace/Shares.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel {
@@ -28,8 +30,8 @@ namespace tessel {
 class TraceObjectSink {
  public:
   virtual ~TraceObjectSink() = default;
-  // Whether the assembler shall make an object of this subsystem and category.
-  virtual bool admits(StringRef subsystem, StringRef category) = 0;
+  // Whether the assembler shall make the object. If so, it delivers it next.
+  virtual bool admits(const ObjectOffer& offer) = 0;
   virtual void deliverEvent(std::shared_ptr<const TesselEvent> event) = 0;
   virtual void deliverInterval(std::shared_ptr<const TesselInterval> interval) = 0;
   virtual void deliverAnimationInterval(
@@ -54,9 +56,10 @@ void addLosses(const AssemblyCounts& counts, Losses& losses);
 
 class IntervalAssembler {
  public:
-  // REQUIRES: table and sink outlive the assembler. Nobody else keeps tokens of the table from one
-  // consume() to the next.
-  IntervalAssembler(TracePointTable& table, TraceObjectSink& sink, OpenIntervalLimits limits = {});
+  // REQUIRES: table, writers and sink outlive the assembler. Nobody else keeps tokens of the table
+  // from one consume() to the next.
+  IntervalAssembler(TracePointTable& table, Writers& writers, TraceObjectSink& sink,
+                    OpenIntervalLimits limits = {});
   IntervalAssembler(const IntervalAssembler&) = delete;
   IntervalAssembler& operator=(const IntervalAssembler&) = delete;
 
@@ -64,6 +67,8 @@ class IntervalAssembler {
   // starts a new generation here.
   void consume(const Entry& entry);
   AssemblyCounts counts() const;
+  // The writer of the current entry. REQUIRES: called by the sink.
+  Origin writer() const { return writerOf(table_, point_.tokens); }
 
  private:
   struct Point {
@@ -74,25 +79,41 @@ class IntervalAssembler {
     FieldToken operator[](FieldKind kind) const { return tokens[static_cast<size_t>(kind)]; }
   };
 
+  struct RecentWriter {
+    FieldToken image = kNoToken;
+    FieldToken user = kNoToken;
+    FieldToken owner = kNoToken;
+    uint32_t number = FlatIndex::kNone;
+
+    bool operator==(const RecentWriter&) const = default;
+  };
+
   void take(const Entry& entry);
   void startGeneration();
   bool meansToBeATracePoint(std::span<const FieldToken> tokens) const;
   void read(std::span<const FieldToken> tokens);
+  void readRepeated(std::span<const FieldToken> tokens);
+  FieldToken lesserFault(FieldToken a, FieldToken b) const;
   std::optional<MalformedReason> fault() const;
   void emitEvent();
   void begin(const EntryHeader& header);
   void end(const EntryHeader& header);
   void deliverMerged(const PointTokens& begin, const std::vector<FieldToken>& attributes,
                      float measuredSeconds);
+  uint32_t writerNumber();
   IntervalKey keyOf(const EntryHeader& header);
   TracePointFields fieldsOf(const PointTokens& tokens, float measuredSeconds) const;
   EmittingProcess processOf(const PointTokens& tokens) const;
   void appendAttributes(const std::vector<FieldToken>& tokens, IntervalFields& interval) const;
 
   TracePointTable& table_;
+  Writers& writers_;
   TraceObjectSink& sink_;
   OpenIntervals open_;
   Point point_{};
+  // By the token of the image. Valid within one generation.
+  static constexpr size_t kRecentWriters = 1024;
+  std::array<RecentWriter, kRecentWriters> recentWriters_{};
   AssemblyCounts counts_;
 };
 

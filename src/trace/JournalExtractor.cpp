@@ -1,4 +1,4 @@
-// The reading loop, the books of a run, and the limit on pairs.
+// The reading loop, the books of a run, and what the delivery of an object costs its writer.
 
 #include "trace/JournalExtractor.h"
 
@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "journal/JournalStore.h"
+#include "platform/Analytics.h"
 #include "platform/Invariant.h"
 #include "platform/Log.h"
 
@@ -21,15 +22,14 @@ uint64_t microsecondsSince1970(Date date) {
 // The books of the run must balance, or the summary of the run would be wrong. Every trace point is
 // an event, a begin or an end. A begin met its end, was replaced, was dropped or still waits. An
 // end met its begin or did not. Every event and every matched end made an object, which was
-// delivered or refused by the limit on pairs.
+// delivered, or refused because its writer had more than his share.
 void checkBooks(const ExtractionReport& report) {
   const AssemblyCounts& counts = report.assembly;
   const uint64_t begins = counts.pairedEnds + counts.replacedBegins + counts.droppedOpenIntervals +
                           counts.openIntervals;
   const uint64_t ends = counts.pairedEnds + counts.unmatchedEnds;
-  const uint64_t refused = report.store.reading.losses.sum(LossCode::beyondPairLimit);
   TESSEL_INVARIANT(counts.tracePoints == counts.events + begins + ends);
-  TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + refused);
+  TESSEL_INVARIANT(counts.events + counts.pairedEnds == report.delivered + report.refused);
 }
 
 // We log at the end of the reading, one line for each loss of the list. A line for each damaged
@@ -43,31 +43,21 @@ void logLosses(const Losses& losses) {
 
 }  // namespace
 
-bool PairLimit::admits(StringRef subsystem, StringRef category) {
-  const Pair pair{subsystem.hash(), category.hash()};
-  // Both hashes are seeded, so the sum needs no seed. The odd factor keeps pairs of two equal
-  // texts, and pairs whose texts change places, apart.
-  const auto hash = static_cast<uint32_t>(pair.subsystem + pair.category * 0x9e3779b97f4a7c15u);
-  const auto isPair = [&](uint32_t number) { return pairs_[number] == pair; };
-  // Nearly every object has a pair that was admitted before.
-  if (index_.find(hash, isPair) != FlatIndex::kNone) return true;
-  const size_t text = subsystem.textOr("").size() + category.textOr("").size();
-  if (pairs_.size() >= limits_.pairs || textBytes_ + text > limits_.textBytes) {
-    ++refusals_;
-    return false;
-  }
-  index_.add(hash, static_cast<uint32_t>(pairs_.size()));
-  pairs_.push_back(pair);
-  textBytes_ += text;
-  return true;
-}
-
 JournalExtractor::JournalExtractor(std::optional<std::string> systemStore,
                                    const ExtractionLimits& limits)
     : systemStore_(std::move(systemStore)),
       table_(limits.table),
-      pairs_(limits.pairs),
-      assembler_(table_, *this, limits.openIntervals) {}
+      shares_(writers_, limits.shares),
+      assembler_(table_, writers_, *this, limits.openIntervals) {}
+
+void JournalExtractor::chargeBy(Clock& clock, std::function<Spending()> spending) {
+  clock_ = &clock;
+  const Timebase timebase = clock.timebase();
+  nanosecondsPerTick_ =
+      static_cast<double>(timebase.numerator) / static_cast<double>(timebase.denominator);
+  spending_ = std::move(spending);
+  spent_ = spending_();  // earlier runs of the process have spent as well
+}
 
 void JournalExtractor::setIntervalCompletionProcessingBlock(IntervalCallback callback) {
   interval_ = std::move(callback);
@@ -88,11 +78,13 @@ void JournalExtractor::stopProcessing() { stop_.store(true, std::memory_order_re
 bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string>& path,
                                                  Date startDate, Date endDate,
                                                  std::optional<PlatformError>& errorOut) {
+  const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
+  report_.store.reading.rangeStart = range.start;
+  report_.store.reading.rangeEnd = range.end;
   if (stop_.load(std::memory_order_relaxed)) {
     report_.stopped = true;
     return true;
   }
-  const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
   auto opened = JournalStore::open(path ? path : systemStore_, range, table_, stop_, status_);
   if (auto* error = std::get_if<PlatformError>(&opened)) {
     errorOut = std::move(*error);
@@ -108,14 +100,23 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
 // The loop looks at the stop flag between two entries only. So it finishes each entry that it
 // began, and the books balance wherever a stop ends it.
 void JournalExtractor::processEntries(EntryStream& entries) {
-  while (!refused_ && !stop_.load(std::memory_order_relaxed) && entries.next()) {
+  bool reachedEnd = false;
+  std::optional<uint64_t> last = report_.lastEntry;
+  while (!refused_ && !stop_.load(std::memory_order_relaxed)) {
+    if (!entries.next()) {
+      // A stream may end because of the stop. A stop that comes later cuts nothing short.
+      reachedEnd = !stop_.load(std::memory_order_relaxed);
+      break;
+    }
     ++report_.entriesRead;
     const Entry entry = entries.entry();
     current_ = &entry.header;
+    last = entry.header.realtime;
     assembler_.consume(entry);
   }
+  report_.lastEntry = last;
   checkBooks(report());
-  report_.stopped = refused_ || stop_.load(std::memory_order_relaxed);
+  report_.stopped = !reachedEnd;
 }
 
 // A caller may go on processing after a report, and the counts of the assembler grow. So report_
@@ -123,29 +124,56 @@ void JournalExtractor::processEntries(EntryStream& entries) {
 ExtractionReport JournalExtractor::report(const StoreReport& store) const {
   ExtractionReport report = report_;
   report.assembly = assembler_.counts();
-  report.pairs = pairs_.pairs();
+  report.pairs = shares_.pairs();
+  report.refused = shares_.refusals();
   report.store = store;
-  Losses& losses = report.store.reading.losses;
-  addLosses(report.assembly, losses);
-  losses.add(LossCode::beyondPairLimit, "too many pairs of subsystem and category", {},
-             pairs_.refusals());
+  StoreReading& reading = report.store.reading;
+  reading.lastEntry = report_.lastEntry;
+  reading.stopped = report_.stopped;
+  addLosses(report.assembly, reading.losses);
+  writers_.addLosses(reading.losses);
   return report;
 }
 
 std::optional<StoreReading> JournalExtractor::reading() const {
-  if (report_.store.files.empty()) return std::nullopt;  // the store could not be opened
+  // Without files the store could not be opened, unless a stop came before.
+  if (report_.store.files.empty() && !report_.stopped) return std::nullopt;
   return report().store.reading;
 }
 
-bool JournalExtractor::admits(StringRef subsystem, StringRef category) {
-  return pairs_.admits(subsystem, category);
-}
+bool JournalExtractor::admits(const ObjectOffer& offer) { return shares_.admits(offer); }
 
-// We count before the call, because a callback that answers false did receive its object.
+// We count before the call, because a callback that answers false did receive its object. Only what
+// is marked for telemetry can be sent. Anything else costs a callback less than two looks at the
+// clock would, so it is not measured.
 template <typename Callback, typename Object>
 void JournalExtractor::deliver(const Callback& callback, const Object& object) {
   ++report_.delivered;
-  if (callback && !callback(object)) refused_ = true;
+  if (!callback) return;
+  const bool measured = spending_ && object->telemetryEnabled();
+  if (!(measured ? callMeasured(callback, object) : callback(object))) refused_ = true;
+}
+
+template <typename Callback, typename Object>
+bool JournalExtractor::callMeasured(const Callback& callback, const Object& object) {
+  const uint64_t began = clock_->continuousTicks();
+  const bool answer = callback(object);
+  charge(clock_->continuousTicks() - began);
+  return answer;
+}
+
+// The throttle sleeps in each tenth step for all ten. So a step costs its writer its tenth part,
+// whoever makes the tenth, and the sleep itself is taken out of the measured time.
+void JournalExtractor::charge(uint64_t ticks) {
+  const Spending now = spending_();
+  const uint64_t slept = now.sleptTicks - spent_.sleptTicks;
+  // Both are differences of the same clock, and the sleep lies within the callback.
+  TESSEL_INVARIANT(slept <= ticks);
+  const std::chrono::nanoseconds steps = (now.steps - spent_.steps) * Throttle::kTimeOfAStep;
+  const auto rest = static_cast<double>(ticks - slept) * nanosecondsPerTick_;
+  shares_.charge(assembler_.writer(), now.rowBytes - spent_.rowBytes,
+                 static_cast<uint64_t>(steps.count()) + static_cast<uint64_t>(rest));
+  spent_ = now;
 }
 
 void JournalExtractor::deliverEvent(std::shared_ptr<const TesselEvent> event) {

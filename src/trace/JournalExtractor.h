@@ -20,52 +20,24 @@
 #include "journal/EntryStream.h"
 #include "journal/StoreReport.h"
 #include "objects/TesselSupportObjectExtractor.h"
-#include "platform/FlatIndex.h"
 #include "platform/System.h"
 #include "trace/IntervalAssembler.h"
+#include "trace/Shares.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel {
 
-// At its end a run spends time and memory on each (subsystem, category) pair, and a writer may make
-// up any number of pairs. So there is a limit. A machine full of programs has fewer than 4,096
-// pairs. 4 MiB of text leave 1 KiB for the names of each.
-struct PairLimits {
-  size_t pairs = 4096;
-  size_t textBytes = size_t{4} * 1024 * 1024;  // of all subsystems and categories together
-};
-
-// Admits distinct pairs up to the limits and refuses all further ones. To save memory it keeps two
-// 64-bit hashes of a pair and no text. The hashes are seeded, so a writer cannot make up two pairs
-// that share both.
-class PairLimit {
- public:
-  explicit PairLimit(PairLimits limits = {}) : limits_(limits) {}
-
-  // True if the pair was admitted before or if there is room for it now. Counts each refusal.
-  bool admits(StringRef subsystem, StringRef category);
-  size_t pairs() const { return pairs_.size(); }
-  uint64_t refusals() const { return refusals_; }
-
- private:
-  struct Pair {
-    uint64_t subsystem = 0;
-    uint64_t category = 0;
-
-    bool operator==(const Pair&) const = default;
-  };
-
-  const PairLimits limits_;
-  std::vector<Pair> pairs_;  // the admitted pairs
-  FlatIndex index_;          // of pairs_
-  size_t textBytes_ = 0;
-  uint64_t refusals_ = 0;
-};
-
 struct ExtractionLimits {
   TracePointTableLimits table;
   OpenIntervalLimits openIntervals;
-  PairLimits pairs;
+  ShareLimits shares;
+};
+
+// What sending has cost the process so far. The difference over a callback is what its object cost.
+struct Spending {
+  uint64_t steps = 0;       // of the throttle
+  uint64_t sleptTicks = 0;  // in these steps, by the clock's ticks
+  uint64_t rowBytes = 0;    // of the rows that were handed to the spool
 };
 
 // The books of all processing calls so far.
@@ -73,9 +45,12 @@ struct ExtractionReport {
   uint64_t entriesRead = 0;  // all entries, also ordinary log messages
   AssemblyCounts assembly;
   uint64_t delivered = 0;  // objects handed to a callback
+  uint64_t refused = 0;    // objects of writers over their share, handed to none
   uint64_t pairs = 0;      // distinct (subsystem, category) that were admitted
-  bool stopped = false;    // by stopProcessing() or a callback that answered false
-  StoreReport store;       // its losses also cover the trace points of `assembly`
+  // By stopProcessing() or a callback that answered false, before the end was reached.
+  bool stopped = false;
+  std::optional<uint64_t> lastEntry;  // microseconds since 1970; absent if none was read
+  StoreReport store;                  // its losses also cover the trace points of `assembly`
 };
 
 class JournalExtractor final : public TesselSupportObjectExtractor, private TraceObjectSink {
@@ -86,6 +61,10 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
                             const ExtractionLimits& limits = {});
   // Reports the progress of reading to `status`. REQUIRES: `status` outlives the extractor.
   void reportProgressTo(ServiceStatus& status) { status_ = &status; }
+  // Lets each object cost its writer what its callback takes. Without this, time and text have no
+  // shares. `spending` is called on the thread of the run; nobody else may spend meanwhile.
+  // REQUIRES: `clock` outlives the extractor.
+  void chargeBy(Clock& clock, std::function<Spending()> spending);
 
   void setIntervalCompletionProcessingBlock(IntervalCallback callback) override;
   void setAnimationIntervalCompletionProcessingBlock(AnimationIntervalCallback callback) override;
@@ -115,16 +94,20 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   ExtractionReport report(const StoreReport& store) const;
 
  private:
-  bool admits(StringRef subsystem, StringRef category) override;
+  bool admits(const ObjectOffer& offer) override;
   void deliverEvent(std::shared_ptr<const TesselEvent> event) override;
   void deliverInterval(std::shared_ptr<const TesselInterval> interval) override;
   void deliverAnimationInterval(std::shared_ptr<const TesselAnimationInterval> interval) override;
   template <typename Callback, typename Object>
   void deliver(const Callback& callback, const Object& object);
+  template <typename Callback, typename Object>
+  bool callMeasured(const Callback& callback, const Object& object);
+  void charge(uint64_t ticks);
 
   const std::optional<std::string> systemStore_;
   TracePointTable table_;
-  PairLimit pairs_;
+  Writers writers_;
+  Shares shares_;
   IntervalAssembler assembler_;
   StopFlag stop_ = false;
   bool refused_ = false;  // a callback answered false
@@ -133,6 +116,10 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   AnimationIntervalCallback animationInterval_;
   EventCallback event_;
   ServiceStatus* status_ = nullptr;
+  Clock* clock_ = nullptr;
+  std::function<Spending()> spending_;
+  Spending spent_;  // by the objects so far
+  double nanosecondsPerTick_ = 0;
 
   const EntryHeader* current_ = nullptr;  // the entry that was read last
   ExtractionReport report_;

@@ -1,4 +1,4 @@
-// The slab of begins, their list by age, and the limits.
+// The slab of begins, their lists by age, and who loses his begins when room gets scarce.
 
 #include "trace/OpenIntervals.h"
 
@@ -19,9 +19,47 @@ uint32_t hashOf(const IntervalKey& key) {
                    uint64_t{key.process});
 }
 
+// Whose turn it is when room is shared out: the user who took least so far, and among his programs
+// the one that took least.
+class Turns {
+ public:
+  explicit Turns(const Writers& writers) : writers_(writers), programs_(writers.users()) {}
+
+  void join(uint32_t writer) {
+    users_.set(writers_.userOf(writer), kNothingTaken);
+    programs_[writers_.userOf(writer)].set(writers_.placeOf(writer), kNothingTaken);
+  }
+  // FlatIndex::kNone if nobody is left.
+  uint32_t next() {
+    while (!users_.empty() && users_.amountOf(users_.first()) != kLeft) {
+      const uint32_t user = users_.first();
+      const uint32_t place = programs_[user].first();
+      if (programs_[user].amountOf(place) != kLeft) return writers_.at(user, place);
+      users_.set(user, kLeft);
+    }
+    return FlatIndex::kNone;
+  }
+  void took(uint32_t writer, size_t room, bool wantsMore) {
+    const uint32_t user = writers_.userOf(writer);
+    const uint32_t place = writers_.placeOf(writer);
+    users_.set(user, users_.amountOf(user) - room);
+    programs_[user].set(place, wantsMore ? programs_[user].amountOf(place) - room : kLeft);
+  }
+
+ private:
+  // A ranking puts the greatest amount first, so we count down from here.
+  static constexpr uint64_t kNothingTaken = UINT64_MAX;
+  static constexpr uint64_t kLeft = 0;
+
+  const Writers& writers_;
+  Ranking users_;
+  std::vector<Ranking> programs_;  // by user
+};
+
 }  // namespace
 
-OpenIntervals::OpenIntervals(OpenIntervalLimits limits) : limits_(limits) {}
+OpenIntervals::OpenIntervals(Writers& writers, OpenIntervalLimits limits)
+    : writers_(writers), limits_(limits), intervals_(writers), attributes_(writers) {}
 
 uint32_t OpenIntervals::numberOf(const IntervalKey& key, uint32_t hash) const {
   return index_.find(hash, [&](uint32_t number) { return nodes_[number].key == key; });
@@ -33,9 +71,11 @@ const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
 }
 
 // The replaced interval leaves before the new one enters. So the new one becomes the youngest, and
-// the attributes of the old one use up none of the limit.
-bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
-                         const std::vector<FieldToken>& attributes) {
+// the attributes of the old one use up none of the limit. If everyone else holds less, even the new
+// interval goes; one entry has at most 32 attributes, so only a limit below 32, as a test may set,
+// can be exceeded by a single interval, which then stays.
+bool OpenIntervals::open(const IntervalKey& key, uint32_t writer, uint64_t monotonic,
+                         const PointTokens& tokens, const std::vector<FieldToken>& attributes) {
   const uint32_t hash = hashOf(key);
   const uint32_t replaced = numberOf(key, hash);
   if (replaced != kNone) remove(replaced);
@@ -45,16 +85,13 @@ bool OpenIntervals::open(const IntervalKey& key, uint64_t monotonic, const Point
   node.monotonic = monotonic;
   node.tokens = tokens;
   node.attributes = attributes;
-  attributes_ += attributes.size();
   node.hash = hash;
+  node.writer = writer;
   link(number);
   index_.add(hash, number);
-  // We never drop the interval that was just opened. One entry has at most 32 attributes, so only a
-  // limit below 32, as a test may set, can be exceeded by a single interval.
-  while (size_ > limits_.intervals || (attributes_ > limits_.attributes && size_ > 1)) {
-    remove(oldest_);
-    ++dropped_;
-  }
+  while (size() > limits_.intervals) drop(ends_[intervals_.greatest()].oldest);
+  while (attributes_.total() > limits_.attributes && size() > 1)
+    drop(ends_[attributes_.greatest()].oldest);
   return replaced != kNone;
 }
 
@@ -74,47 +111,74 @@ uint32_t OpenIntervals::newNode() {
 }
 
 void OpenIntervals::link(uint32_t number) {
-  nodes_[number].older = youngest_;
-  nodes_[number].younger = kNone;
-  (youngest_ == kNone ? oldest_ : nodes_[youngest_].younger) = number;
-  youngest_ = number;
-  ++size_;
+  Node& node = nodes_[number];
+  if (ends_.size() <= node.writer) ends_.resize(node.writer + 1);
+  Ends& ends = ends_[node.writer];
+  node.older = ends.youngest;
+  node.younger = kNone;
+  (ends.youngest == kNone ? ends.oldest : nodes_[ends.youngest].younger) = number;
+  ends.youngest = number;
+  intervals_.change(node.writer, 1);
+  if (!node.attributes.empty())
+    attributes_.change(node.writer, static_cast<int64_t>(node.attributes.size()));
 }
 
 void OpenIntervals::remove(uint32_t number) {
   index_.erase(nodes_[number].hash, number);
   release(number);
-  // Every open interval is both in the list by age and in the index. An interval that is missing in
-  // the index would never meet its end. One that is missing in the list would never be dropped.
-  TESSEL_INVARIANT(index_.size() == size_);
+  // Every open interval is both in the list of its writer and in the index. An interval that is
+  // missing in the index would never meet its end. One that is missing in the list would never be
+  // dropped.
+  TESSEL_INVARIANT(index_.size() == size());
+}
+
+void OpenIntervals::drop(uint32_t number) {
+  writers_.lost(nodes_[number].writer, LossCode::openIntervalDropped);
+  remove(number);
 }
 
 void OpenIntervals::release(uint32_t number) {
   Node& node = nodes_[number];
-  (node.older == kNone ? oldest_ : nodes_[node.older].younger) = node.younger;
-  (node.younger == kNone ? youngest_ : nodes_[node.younger].older) = node.older;
-  attributes_ -= node.attributes.size();
+  Ends& ends = ends_[node.writer];
+  (node.older == kNone ? ends.oldest : nodes_[node.older].younger) = node.younger;
+  (node.younger == kNone ? ends.youngest : nodes_[node.younger].older) = node.older;
+  intervals_.change(node.writer, -1);
+  if (!node.attributes.empty())
+    attributes_.change(node.writer, -static_cast<int64_t>(node.attributes.size()));
   node.attributes = std::vector<FieldToken>();  // clear() would keep the memory of each free node
   node.older = std::exchange(free_, number);
-  --size_;
 }
 
-// New tokens give each key a new hash, so we build the index anew. We start with the youngest
-// interval: if there is no room for all, the oldest must go, as with the limits.
-void OpenIntervals::renewAll(const std::function<bool(OpenInterval&)>& renew) {
+// New tokens give each key a new hash, so we build the index anew. We serve the writers in the
+// order of what they took so far, so that the room is shared like water in vessels: whoever needs
+// little gets all of it, and the others get equal parts. Texts that two writers share count for the
+// first one only.
+void OpenIntervals::renewAll(const std::function<std::optional<size_t>(OpenInterval&)>& renew) {
   index_.clear();
-  uint32_t at = youngest_;
-  for (; at != kNone && renew(nodes_[at]); at = nodes_[at].older) {
-    nodes_[at].hash = hashOf(nodes_[at].key);
-    index_.add(nodes_[at].hash, at);
+  Turns turns(writers_);
+  std::vector<uint32_t> left(ends_.size());  // by writer: the youngest one that is left
+  for (uint32_t writer = 0; writer < ends_.size(); ++writer) {
+    left[writer] = ends_[writer].youngest;
+    if (left[writer] != kNone) turns.join(writer);
   }
-  while (at != kNone) {
-    const uint32_t older = nodes_[at].older;
-    release(at);
-    ++dropped_;
-    at = older;
+  for (uint32_t writer = turns.next(); writer != kNone; writer = turns.next()) {
+    Node& node = nodes_[left[writer]];
+    const std::optional<size_t> room = renew(node);
+    if (!room) break;
+    node.hash = hashOf(node.key);
+    index_.add(node.hash, left[writer]);
+    left[writer] = node.older;
+    turns.took(writer, *room, node.older != kNone);
   }
-  TESSEL_INVARIANT(index_.size() == size_);
+  for (uint32_t at : left) {
+    while (at != kNone) {
+      const uint32_t older = nodes_[at].older;
+      writers_.lost(nodes_[at].writer, LossCode::openIntervalDropped);
+      release(at);
+      at = older;
+    }
+  }
+  TESSEL_INVARIANT(index_.size() == size());
 }
 
 }  // namespace tessel

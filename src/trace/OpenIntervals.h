@@ -1,12 +1,15 @@
 // OpenIntervals keeps the begins that wait for their end.
 //
-// The begins lie in a slab. An index finds them by key, and a list links them by age. If there are
-// too many, the oldest is dropped, because the longest overdue end is the least likely to come. A
-// begin that replaces another becomes the youngest, because its own end is not overdue yet. The
-// slab never shrinks: it has room for as many begins as were ever open at once.
+// The begins lie in a slab. An index finds them by key, and a list for each writer links his begins
+// by age. While there is room, everyone may have as many as he likes. If there are too many, the
+// writer who holds most loses his oldest begin: whoever floods us pays for it himself, and the
+// longest overdue end is the least likely to come. A begin that replaces another becomes the
+// youngest, because its own end is not overdue yet. The slab never shrinks: it has room for as many
+// begins as were ever open at once.
 //
 // An interval keeps its tokens while other entries are read. When the table starts a new
-// generation, renewAll() exchanges them.
+// generation, renewAll() exchanges them. The new generation may have too little room for all their
+// text. Those who hold least are then served first.
 //
 // Threads: one at a time.
 
@@ -16,15 +19,15 @@
 #include <compare>
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <vector>
 
 #include "journal/EntryStream.h"
 #include "platform/FlatIndex.h"
 #include "trace/TracePointFields.h"
+#include "trace/Writers.h"
 
 namespace tessel {
-
-using PointTokens = std::array<FieldToken, kPointSlots>;
 
 // A begin and an end belong together if their keys are equal.
 struct IntervalKey {
@@ -50,7 +53,7 @@ struct OpenInterval {
 };
 
 // A writer that never ends its intervals must not use up our memory. No ordinary machine has 65,536
-// intervals open at once; at 160 bytes a begin they take 10 MiB. An attribute is a token of 4
+// intervals open at once; at 168 bytes a begin they take 10.5 MiB. An attribute is a token of 4
 // bytes, so 262,144 attributes take 1 MiB. That is four attributes for each begin.
 struct OpenIntervalLimits {
   size_t intervals = 65'536;
@@ -59,30 +62,36 @@ struct OpenIntervalLimits {
 
 class OpenIntervals {
  public:
-  explicit OpenIntervals(OpenIntervalLimits limits = {});
+  // Drops are noted as losses of their writers. REQUIRES: `writers` outlives this object.
+  explicit OpenIntervals(Writers& writers, OpenIntervalLimits limits = {});
 
-  // Opens an interval. If one is open under the same key, replaces it and answers true.
-  bool open(const IntervalKey& key, uint64_t monotonic, const PointTokens& tokens,
+  // Opens an interval of `writer`. If one is open under the same key, replaces it and answers true.
+  bool open(const IntervalKey& key, uint32_t writer, uint64_t monotonic, const PointTokens& tokens,
             const std::vector<FieldToken>& attributes);
   // The open interval under `key`, or null; valid until the next call that is not const.
   const OpenInterval* find(const IntervalKey& key) const;
   // REQUIRES: `interval` was answered by find().
   void close(const OpenInterval* interval);
 
-  // Calls `renew` on each interval, from the youngest to the oldest. `renew` may change the key.
-  // When it first answers false, that interval and all older ones are dropped.
-  void renewAll(const std::function<bool(OpenInterval&)>& renew);
+  // Calls `renew` on the intervals, each time on the youngest one left of the writer whose
+  // intervals took the least so far. `renew` may change the key, and answers how much room the
+  // interval takes now. When it first answers nothing, that interval and all that are left are
+  // dropped.
+  void renewAll(const std::function<std::optional<size_t>(OpenInterval&)>& renew);
 
-  size_t size() const { return size_; }
-  // The number of begins dropped by the limits or by renewAll().
-  uint64_t dropped() const { return dropped_; }
+  size_t size() const { return intervals_.total(); }
 
  private:
   static constexpr uint32_t kNone = FlatIndex::kNone;
   struct Node : OpenInterval {
-    uint32_t hash = 0;       // of the key
-    uint32_t older = kNone;  // in a free node: the next free node
+    uint32_t hash = 0;  // of the key
+    uint32_t writer = 0;
+    uint32_t older = kNone;  // of the same writer; in a free node: the next free node
     uint32_t younger = kNone;
+  };
+  struct Ends {
+    uint32_t oldest = kNone;
+    uint32_t youngest = kNone;
   };
 
   uint32_t numberOf(const IntervalKey& key, uint32_t hash) const;
@@ -90,16 +99,16 @@ class OpenIntervals {
   void link(uint32_t number);
   void remove(uint32_t number);
   void release(uint32_t number);
+  void drop(uint32_t number);
 
+  Writers& writers_;
   const OpenIntervalLimits limits_;
   std::vector<Node> nodes_;
-  FlatIndex index_;  // of nodes_, by the key
+  FlatIndex index_;         // of nodes_, by the key
+  std::vector<Ends> ends_;  // by writer
+  Holdings intervals_;
+  Holdings attributes_;
   uint32_t free_ = kNone;
-  uint32_t oldest_ = kNone;
-  uint32_t youngest_ = kNone;
-  size_t size_ = 0;  // nodes in the list by age
-  size_t attributes_ = 0;
-  uint64_t dropped_ = 0;
 };
 
 }  // namespace tessel

@@ -46,6 +46,8 @@ enum class FieldKind : uint8_t {
   imagePath,
   processName,
   process,
+  user,
+  sessionOwner,
   attribute,
   // These two are no journal fields. `malformed` stands for a bad value of any field, `boot` for
   // the boot that the header of an entry names.
@@ -113,7 +115,7 @@ enum class ValueForm : uint8_t {
   flag,        // "1" is yes, any other text is no
   real,        // a decimal that a 32-bit float can hold; any other text is bad
   number,      // a decimal; with any other text the field counts as absent
-  process,     // a number that pairing compares
+  recurring,   // a number that many entries share
   attribute,   // KEY=VALUE with a key; any other text is bad
 };
 
@@ -157,7 +159,9 @@ inline constexpr JournalField kJournalFields[] = {
     {FieldKind::frameRate, "TESSEL_FRAME_RATE", ValueForm::real, MalformedReason::invalidFrameRate},
     {FieldKind::imagePath, "_EXE"},
     {FieldKind::processName, "_COMM"},
-    {FieldKind::process, "_PID", ValueForm::process},
+    {FieldKind::process, "_PID", ValueForm::recurring},
+    {FieldKind::user, "_UID", ValueForm::recurring},
+    {FieldKind::sessionOwner, "_SYSTEMD_OWNER_UID", ValueForm::recurring},
     {FieldKind::attribute, "TESSEL_ATTRIBUTE", ValueForm::attribute,
      MalformedReason::invalidAttribute},
 };

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <tuple>
 
 #include "platform/Invariant.h"
 
@@ -27,6 +28,7 @@ TracePointTable::Contents TracePointTable::emptyContents(const TracePointTableLi
   // nothing.
   contents.fields.reserve(limits.fields + kRoomForOneEntry);
   contents.fields.emplace_back();  // the value of kNoToken: no text, no number, identity 0
+  contents.fields.back().noted = true;
   return contents;
 }
 
@@ -86,7 +88,7 @@ FieldToken TracePointTable::parse(const JournalField& field, std::string_view va
       return add(parsed);
     }
     case ValueForm::number:
-    case ValueForm::process:
+    case ValueForm::recurring:
       return parseNumber(field, value);
     case ValueForm::attribute: {
       const size_t equals = value.find('=');
@@ -97,8 +99,9 @@ FieldToken TracePointTable::parse(const JournalField& field, std::string_view va
   return malformedToken(kind, *field.whenBad);
 }
 
-// Most numbers occur in one entry only, so we add them without a search for an equal one. Process
-// numbers need the search, because pairing compares their tokens.
+// Most numbers occur in one entry only, so we add them without a search for an equal one. Numbers
+// of processes and users recur. Pairing also compares the tokens of processes, so equal ones must
+// have equal tokens.
 FieldToken TracePointTable::parseNumber(const JournalField& field, std::string_view value) {
   const std::optional<Number> number = parseDecimal(value);
   if (!number) return kNoToken;
@@ -112,7 +115,7 @@ FieldToken TracePointTable::parseNumber(const JournalField& field, std::string_v
   } else {
     parsed.whole = static_cast<uint64_t>(std::get<int64_t>(*number));
   }
-  return field.form == ValueForm::process ? addOnce(parsed) : add(parsed);
+  return field.form == ValueForm::recurring ? addOnce(parsed) : add(parsed);
 }
 
 // Most ids are numbers that only one begin and one end have. To intern their texts would fill the
@@ -192,6 +195,25 @@ std::optional<Number> TracePointTable::number(FieldToken token) const {
   }
 }
 
+// A double holds every number nearly. Where two numbers are equal in it, their forms and their bits
+// decide, so that the answer never depends on the order of the tokens.
+bool TracePointTable::isGreater(FieldToken token, FieldToken other) const {
+  const Field& a = at(token);
+  const Field& b = at(other);
+  if (a.form == Form::text && b.form == Form::text)
+    return StringRef(a.record).text() > StringRef(b.record).text();
+  if (a.form == Form::text || b.form == Form::text) return a.form == Form::text;
+  const auto key = [](const Field& field) {
+    const double value = field.form == Form::fraction ? field.fraction
+                         : field.form == Form::real   ? double{field.real}
+                         : field.form == Form::unsignedWhole
+                             ? static_cast<double>(field.whole)
+                             : static_cast<double>(static_cast<int64_t>(field.whole));
+    return std::tuple(value, field.form, field.whole);
+  };
+  return key(a) > key(b);
+}
+
 PointKind TracePointTable::pointKind(FieldToken token) const {
   return static_cast<PointKind>(at(token).whole);
 }
@@ -232,7 +254,7 @@ FieldToken TracePointTable::Renewal::addAgain(const Field& old) {
   // We add numbers and numeric ids without a search, as parse() does.
   const ValueForm form = journalField(old.kind).form;
   const bool once =
-      form == ValueForm::word || form == ValueForm::flag || form == ValueForm::process;
+      form == ValueForm::word || form == ValueForm::flag || form == ValueForm::recurring;
   return once ? table_.addOnce(old) : table_.add(old);
 }
 

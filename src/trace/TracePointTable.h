@@ -15,7 +15,9 @@
 
 #pragma once
 
+#include <array>
 #include <memory>
+#include <optional>
 #include <utility>
 #include <vector>
 
@@ -33,6 +35,13 @@ struct TracePointTableLimits {
   size_t fields = size_t{512} * 1024;          // distinct values; at most 15 million
   size_t textBytes = size_t{6} * 1024 * 1024;  // of interned text, its bookkeeping included
 };
+
+// The tokens of one trace point, by kind.
+using PointTokens = std::array<FieldToken, kPointSlots>;
+
+inline FieldToken tokenOf(const PointTokens& tokens, FieldKind kind) {
+  return tokens[static_cast<size_t>(kind)];
+}
 
 class TracePointTable final : public FieldTokenizer {
  public:
@@ -52,11 +61,25 @@ class TracePointTable final : public FieldTokenizer {
   uint64_t identity(FieldToken token) const { return at(token).identity(); }
   StringRef text(FieldToken token) const { return StringRef(at(token).record); }
   std::optional<Number> number(FieldToken token) const;
+  // The number if it can be that of a user.
+  std::optional<uint32_t> user(FieldToken token) const {
+    const Field& field = at(token);
+    if (field.form != Form::whole || field.whole > UINT32_MAX) return std::nullopt;
+    return static_cast<uint32_t>(field.whole);
+  }
   float real(FieldToken token) const { return at(token).real; }
   PointKind pointKind(FieldToken token) const;
   // For the telemetry field: whether it is on. For a scope: whether it is "system".
   bool flag(FieldToken token) const { return at(token).whole != 0; }
   MalformedReason malformedReason(FieldToken token) const;
+  // A mark that the user of the table may set on a value. It lasts as long as the token, and an
+  // absent value has it.
+  bool noted(FieldToken token) const { return at(token).noted; }
+  void note(FieldToken token) { contents_.fields[indexOf(token)].noted = true; }
+  // Whether the value of `token` comes after that of `other`: texts in the order of their bytes,
+  // numbers in that of their values, words in that of their table, and a text after a number.
+  // REQUIRES: both are of one kind, which is neither an attribute nor malformed.
+  bool isGreater(FieldToken token, FieldToken other) const;
   // Whether the bad field is a required one.
   bool malformedIsRequired(FieldToken token) const {
     return (at(token).whole & kMalformedRequired) != 0;
@@ -64,6 +87,11 @@ class TracePointTable final : public FieldTokenizer {
   // The key and the value. REQUIRES: the token is not kNoToken.
   const std::pair<StringRef, StringRef>& attribute(FieldToken token) const {
     return contents_.attributes[at(token).whole];
+  }
+  // Bytes that the values of this generation take, without the room for further ones.
+  size_t bytes() const {
+    return (contents_.fields.size() + contents_.attributes.size()) * sizeof(Field) +
+           contents_.strings->textBytes();
   }
   // Keeps every string of this generation alive.
   std::shared_ptr<const StringPool> strings() const { return contents_.strings; }
@@ -86,6 +114,7 @@ class TracePointTable final : public FieldTokenizer {
     };
     FieldKind kind = FieldKind::malformed;
     Form form = Form::none;
+    bool noted = false;
 
     // The pool keeps one record for equal texts, so the address of the record identifies the text.
     uint64_t identity() const {

@@ -1,109 +1,20 @@
-// What comes out of which entries: pairing, merging, malformed entries, and the bounds on memory.
+// What comes out of which entries: pairing, merging, malformed entries.
 
 #include "trace/IntervalAssembler.h"
 
 #include <gmock/gmock.h>
-#include <gtest/gtest.h>
 
-#include "trace/testing/FakeEntryStream.h"
+#include "trace/testing/AssemblerFixture.h"
 
 namespace tessel {
 namespace {
 
 using ::testing::ElementsAre;
 using testing::FakeEntry;
-using testing::FakeEntryStream;
 using ::testing::IsEmpty;
+using testing::Lines;
 using testing::tracePoint;
-using Lines = std::vector<std::string>;
-
-void add(std::string& line, std::string_view label, StringRef text) {
-  if (text) line += " " + std::string(label) + "=" + std::string(text.text());
-}
-
-// An object in one line; what is absent, zero or false is left out.
-std::string describe(const TesselObject& object) {
-  std::string line(object.tesselType());
-  line +=
-      " " + std::string(object.subsystem().text()) + "/" + std::string(object.category().text());
-  add(line, "name", object.name());
-  add(line, "s1", object.string1Name());
-  add(line, "s1v", object.string1Value());
-  add(line, "s2", object.string2Name());
-  add(line, "s2v", object.string2Value());
-  add(line, "n1", object.number1Name());
-  if (object.number1Value()) line += " n1v=" + numberText(*object.number1Value());
-  add(line, "n2", object.number2Name());
-  if (object.number2Value()) line += " n2v=" + numberText(*object.number2Value());
-  if (object.durationSeconds() != 0) line += " " + numberText(object.durationSeconds()) + "s";
-  if (object.telemetryEnabled()) line += " telemetry";
-  return line;
-}
-
-void addProcess(std::string& line, std::string_view label, const EmittingProcess& process) {
-  add(line, label, process.imagePath);
-  add(line, std::string(label) + "Name", process.name);
-}
-
-class Fixture : public ::testing::Test, protected TraceObjectSink {
- protected:
-  Lines runEntries(std::vector<FakeEntry> entries) {
-    FakeEntryStream stream(table(), std::move(entries));
-    while (stream.next()) assembler().consume(stream.entry());
-    return std::exchange(delivered_, {});
-  }
-  Lines run(const Lines& points) {
-    std::vector<FakeEntry> entries;
-    for (const std::string& point : points) entries.push_back(tracePoint(point));
-    return runEntries(std::move(entries));
-  }
-  TracePointTable& table() {
-    if (!table_) table_ = std::make_unique<TracePointTable>(tableLimits);
-    return *table_;
-  }
-  IntervalAssembler& assembler() {
-    if (!assembler_) assembler_ = std::make_unique<IntervalAssembler>(table(), sink(), openLimits);
-    return *assembler_;
-  }
-
-  TracePointTableLimits tableLimits;
-  OpenIntervalLimits openLimits;
-  std::vector<std::shared_ptr<const TesselObject>> kept;
-  bool keepObjects = false;
-
- private:
-  TraceObjectSink& sink() { return *this; }
-  bool admits(StringRef, StringRef) override { return true; }
-  void deliverEvent(std::shared_ptr<const TesselEvent> event) override {
-    std::string line = describe(*event);
-    addProcess(line, "exe", {event->processImagePath(), event->processName()});
-    remember(std::move(line), event);
-  }
-  void deliverInterval(std::shared_ptr<const TesselInterval> interval) override {
-    remember(describeInterval(*interval), interval);
-  }
-  void deliverAnimationInterval(std::shared_ptr<const TesselAnimationInterval> interval) override {
-    remember(describeInterval(*interval) + " " + numberText(interval->frameRate()) + "fps",
-             interval);
-  }
-  static std::string describeInterval(const TesselInterval& interval) {
-    std::string line = describe(interval);
-    addProcess(line, "begin", interval.beginEvent());
-    addProcess(line, "end", interval.endEvent());
-    add(line, "override", interval.attribute("BundleIdOverride"));
-    return line;
-  }
-  void remember(std::string line, std::shared_ptr<const TesselObject> object) {
-    delivered_.push_back(std::move(line));
-    if (keepObjects) kept.push_back(std::move(object));
-  }
-
-  std::unique_ptr<TracePointTable> table_;
-  std::unique_ptr<IntervalAssembler> assembler_;
-  Lines delivered_;
-};
-
-using IntervalAssemblerTest = Fixture;
+using IntervalAssemblerTest = testing::AssemblerFixture;
 
 TEST_F(IntervalAssemblerTest, everyFieldReachesTheObject) {
   EXPECT_THAT(
@@ -278,78 +189,35 @@ TEST_F(IntervalAssemblerTest, manyAttributesAreMalformed) {
             1u);
 }
 
-TEST_F(IntervalAssemblerTest, theOldestOpenIntervalGoes) {
-  openLimits.intervals = 3;
-  run({"begin|INTERVAL_ID=1", "begin|INTERVAL_ID=2", "begin|INTERVAL_ID=3"});
-  run({"begin|INTERVAL_ID=1", "begin|INTERVAL_ID=4"});  // 1 is young again, so 2 goes
-  EXPECT_EQ(assembler().counts().droppedOpenIntervals, 1u);
-  EXPECT_THAT(run({"end|INTERVAL_ID=2"}), IsEmpty());
-  EXPECT_EQ(run({"end|INTERVAL_ID=1", "end|INTERVAL_ID=3", "end|INTERVAL_ID=4"}).size(), 3u);
-}
-
-TEST_F(IntervalAssemblerTest, openAttributesAreBounded) {
-  openLimits.attributes = 3;
-  run({"begin|INTERVAL_ID=1|ATTRIBUTE=a=1|ATTRIBUTE=b=2",
-       "begin|INTERVAL_ID=2|ATTRIBUTE=a=1|ATTRIBUTE=b=2"});
-  EXPECT_EQ(assembler().counts().droppedOpenIntervals, 1u);
-  EXPECT_EQ(run({"end|INTERVAL_ID=1", "end|INTERVAL_ID=2"}).size(), 1u);
-  run({"begin|INTERVAL_ID=1", "begin|INTERVAL_ID=2|ATTRIBUTE=a=1",
-       "begin|INTERVAL_ID=1|ATTRIBUTE=a=1|ATTRIBUTE=b=2|ATTRIBUTE=c=3"});
-  EXPECT_EQ(assembler().counts().replacedBegins, 1u);
-  EXPECT_EQ(assembler().counts().droppedOpenIntervals, 2u);
-}
-
-TEST_F(IntervalAssemblerTest, intervalsOutliveAGeneration) {
-  tableLimits.fields = 200;
-  run(
-      {"begin|INTERVAL_ID=x|NAME=Open|STRING1_VALUE=week|NUMBER1_VALUE=18446744073709551615|"
-       "NUMBER2_VALUE=0.25|TELEMETRY=1|FRAME_RATE=60|ATTRIBUTE=BundleIdOverride=b|_EXE=/a|_PID=3",
-       "begin|INTERVAL_ID=y|INTERVAL_SCOPE=system|_PID=3"});
-  for (int i = 0; i < 1000; ++i) run({"event|NAME=" + std::to_string(i)});
-  EXPECT_GT(table().generation(), 3u);
-  EXPECT_THAT(
-      run({"end|INTERVAL_ID=x|NAME=Open|_PID=3", "end|INTERVAL_ID=y|INTERVAL_SCOPE=system|_PID=4"}),
-      ElementsAre("AnimationInterval com.vantor.Calendar/View name=Open s1v=week "
-                  "n1v=18446744073709551615 n2v=0.25 telemetry begin=/a override=b 60.0fps",
-                  "Interval com.vantor.Calendar/View"));
-  EXPECT_EQ(assembler().counts().droppedOpenIntervals, 0u);
-}
-
-TEST_F(IntervalAssemblerTest, textOfIntervalsIsBounded) {
-  tableLimits.textBytes = 64 * 1024;
-  size_t opened = 0;
-  for (; table().generation() < 4; ++opened) {
-    run({"begin|INTERVAL_ID=" + std::to_string(opened) +
-         "|STRING1_VALUE=" + std::to_string(opened) + std::string(4000, 'x')});
-    ASSERT_LT(table().strings()->memoryUsed(), 72u * 1024);
+// The journal sorts the fields of an entry, so their order must not matter.
+TEST_F(IntervalAssemblerTest, ofEqualFieldsTheGreatestCounts) {
+  const struct {
+    std::string a, b, delivered;
+  } cases[] = {
+      {"NAME=Open", "NAME=Close", " name=Open"},
+      {"NUMBER1_VALUE=10", "NUMBER1_VALUE=9.5", " n1v=10"},
+      {"NUMBER1_VALUE=5", "NUMBER1_VALUE=5.0", " n1v=5.0"},
+      {"NUMBER1_VALUE=18446744073709551615", "NUMBER1_VALUE=-1", " n1v=18446744073709551615"},
+      {"NUMBER1_VALUE=9007199254740993", "NUMBER1_VALUE=9007199254740992", " n1v=9007199254740993"},
+      {"NUMBER1_VALUE=3", "NUMBER1_VALUE=x", " n1v=3"},
+      {"DURATION=2", "DURATION=10", " 10.0s"},
+      {"TELEMETRY=1", "TELEMETRY=yes", " telemetry"},
+      {"ATTRIBUTE=BundleIdOverride=a", "ATTRIBUTE=BundleIdOverride=b", " override=b"},
+      {"INTERVAL_ID=7", "INTERVAL_ID=x", ""},
+      {"KIND=end", "KIND=begin", ""},
+  };
+  for (const auto& c : cases) {
+    for (const std::string& fields : {c.a + "|" + c.b, c.b + "|" + c.a}) {
+      run({"begin|INTERVAL_ID=x" + (c.a.starts_with("NAME") ? "|" + c.a : "")});
+      const Lines lines = run({"end|INTERVAL_ID=x|" + fields});
+      ASSERT_EQ(lines.size(), 1u) << fields;
+      EXPECT_TRUE(lines[0].ends_with("View" + c.delivered)) << fields << ": " << lines[0];
+    }
   }
-  const AssemblyCounts counts = assembler().counts();
-  EXPECT_GT(counts.droppedOpenIntervals, 0u);
-  EXPECT_EQ(counts.openIntervals + counts.droppedOpenIntervals, opened);
-  EXPECT_EQ(run({"end|INTERVAL_ID=" + std::to_string(opened - 1)}).size(), 1u);
-  EXPECT_THAT(run({"end|INTERVAL_ID=0"}), IsEmpty());
-}
-
-TEST_F(IntervalAssemblerTest, objectsKeepTheirStrings) {
-  tableLimits.fields = 64;
-  keepObjects = true;
-  for (int i = 0; i < 200; ++i) run({"event|STRING1_VALUE=" + std::to_string(i)});
-  ASSERT_GT(table().generation(), 1u);
-  for (size_t i = 0; i < kept.size(); ++i) {
-    EXPECT_EQ(kept[i]->string1Value().text(), std::to_string(i));
-  }
-}
-
-TEST_F(IntervalAssemblerTest, intervalsCloseInAnyOrder) {
-  openLimits.intervals = 5000;
-  const int count = 5000;
-  for (int i = 0; i < count; ++i) run({"begin|INTERVAL_ID=" + std::to_string(i)});
-  for (int i = 0; i < count; ++i) {
-    const int id = (i * 1237) % count;
-    ASSERT_EQ(run({"end|INTERVAL_ID=" + std::to_string(id)}).size(), 1u) << id;
-    ASSERT_THAT(run({"end|INTERVAL_ID=" + std::to_string(id)}), IsEmpty()) << id;
-  }
-  EXPECT_EQ(assembler().counts().openIntervals, 0u);
+  for (const char* fields : {"DURATION=x|FRAME_RATE=x", "FRAME_RATE=x|DURATION=x"})
+    run({"event|" + std::string(fields)});
+  EXPECT_EQ(assembler().counts().malformed[static_cast<size_t>(MalformedReason::invalidDuration)],
+            2u);
 }
 
 }  // namespace

@@ -1,4 +1,4 @@
-// The processing call: delivery, counts, stops, the limit on pairs, and real stores.
+// The processing call: delivery, counts, stops, the shares of writers, and real stores.
 
 #include "trace/JournalExtractor.h"
 
@@ -11,6 +11,7 @@
 #include "journal/EntryRecording.h"
 #include "journal/EntryStream.h"
 #include "os/testing/TemporaryDirectory.h"
+#include "platform/Analytics.h"
 #include "platform/testing/Fakes.h"
 #include "trace/testing/FakeEntryStream.h"
 
@@ -102,24 +103,120 @@ TEST_F(JournalExtractorTest, currentEntryIsTheObjects) {
   EXPECT_THAT(numbers, ElementsAre(1, 2));
 }
 
-TEST_F(JournalExtractorTest, pairsOverTheLimitAreRefused) {
-  limits.pairs.pairs = 2;
-  process({tracePoint("event|CATEGORY=a"), tracePoint("event|CATEGORY=b"),
-           tracePoint("event|CATEGORY=c"), tracePoint("begin|CATEGORY=c"),
-           tracePoint("end|CATEGORY=c"), tracePoint("event|CATEGORY=a"),
-           tracePoint("event|CATEGORY=b|SUBSYSTEM=s")});
-  EXPECT_THAT(delivered, ElementsAre("Event a", "Event b", "Event a"));
-  const ExtractionReport report = extractor().report();
-  EXPECT_EQ(report.pairs, 2u);
-  EXPECT_EQ(report.store.reading.losses.sum(LossCode::beyondPairLimit), 3u);
+// How many of `count` new pairs the writer gets delivered.
+class SharesTest : public JournalExtractorTest {
+ protected:
+  size_t got(const std::string& writer, int count, const std::string& text = "") {
+    const size_t before = delivered.size();
+    std::vector<FakeEntry> entries;
+    for (int i = 0; i < count; ++i)
+      entries.push_back(tracePoint("event|CATEGORY=" + std::to_string(next_++) + text + writer));
+    process(std::move(entries));
+    return delivered.size() - before;
+  }
+  std::vector<std::string> losses() {
+    std::vector<std::string> lines;
+    const ExtractionReport report = extractor().report();
+    for (const Loss& loss : report.store.reading.losses.all()) {
+      if (isOverShare(loss.code))
+        lines.push_back(std::to_string(loss.count) + " " + loss.description());
+    }
+    return lines;
+  }
+
+ private:
+  int next_ = 100'000;
+};
+
+TEST_F(SharesTest, theLastQuarterIsForThoseWhoHoldLittle) {
+  limits.shares.pairs = 256;
+  EXPECT_EQ(got("|_UID=1|_EXE=/a", 300), 144u) << "three quarters of the three quarters for all";
+  EXPECT_EQ(got("|_UID=1|_EXE=/b", 50), 12u) << "a sixteenth of those";
+  for (const char* image : {"/c", "/d", "/e"})
+    EXPECT_EQ(got("|_UID=1|_EXE=" + std::string(image), 50), 12u) << image;
+  EXPECT_EQ(got("|_UID=1|_EXE=/f", 50), 0u) << "the last quarter is for other users";
+  EXPECT_EQ(got("|_UID=2|_EXE=/a", 50), 16u) << "a sixteenth of all";
+  EXPECT_EQ(got("|_UID=2|_EXE=/b", 50), 0u);
+  EXPECT_EQ(got("|_UID=3|_SYSTEMD_OWNER_UID=1|_EXE=/g", 50), 0u) << "a session has one owner";
+  EXPECT_EQ(got("|_UID=3|_SYSTEMD_OWNER_UID=4|_EXE=/g", 50), 16u);
+  EXPECT_EQ(got("", 50), 16u) << "the unknown writer";
+  process({tracePoint("event|CATEGORY=100000|_UID=1|_EXE=/f")});
+  EXPECT_EQ(delivered.back(), "Event 100000") << "who holds a pair does not matter";
+  EXPECT_EQ(extractor().report().pairs, delivered.size() - 1);
+  EXPECT_THAT(losses(), Contains("156 beyond_pair_limit: too many pairs of subsystem and category "
+                                 "(user 1, /a)"));
+  EXPECT_THAT(losses(), Contains("34 beyond_pair_limit: too many pairs of subsystem and category "
+                                 "(unknown user, unknown)"));
+  limits.shares.pairs = 4096;
+  limits.shares.pairBytes = 64 * 1024;
+  startAfresh();
+  EXPECT_EQ(got("|_UID=1|_EXE=/a", 100, std::string(1000, 'x')), 35u) << "text is shared out, too";
+  EXPECT_EQ(got("|_UID=2|_EXE=/a", 50), 50u);
 }
 
-TEST_F(JournalExtractorTest, theTextOfPairsIsLimitedToo) {
-  limits.pairs.textBytes = 64;
-  process({tracePoint("event|CATEGORY=" + std::string(40, 'x')),
-           tracePoint("event|CATEGORY=" + std::string(40, 'y')),
-           tracePoint("event|CATEGORY=" + std::string(40, 'x'))});
-  EXPECT_EQ(delivered.size(), 2u);
+TEST_F(SharesTest, programsAreSharedOutWhereTheyMayBeReported) {
+  limits.shares.images = 64;
+  const auto points = [](const std::string& fields, int count) {
+    std::vector<FakeEntry> entries;
+    for (int i = 0; i < count; ++i) {
+      const std::string image = fields + "/" + std::to_string(i);
+      entries.push_back(tracePoint("begin|INTERVAL_SCOPE=system" + image));
+      entries.push_back(tracePoint("end|INTERVAL_SCOPE=system" + image));
+    }
+    return entries;
+  };
+  process(points("|_UID=1|_EXE=/a", 100));
+  EXPECT_EQ(delivered.size(), 100u) << "nothing looks at the executable of an unmarked object";
+  process(points("|_UID=1|TELEMETRY=1|_EXE=/a", 100));
+  EXPECT_EQ(delivered.size(), 148u);
+  process(points("|_UID=2|TELEMETRY=1|_EXE=/b", 3));
+  process(points("|_UID=1|TELEMETRY=1|_EXE=/a", 10));
+  EXPECT_EQ(delivered.size(), 161u);
+  EXPECT_EQ(losses().size(), 17u) << "sixteen programs and the others";
+  EXPECT_EQ(extractor().report().store.reading.losses.sum(LossCode::beyondImageLimit), 52u);
+}
+
+// A service that takes two steps and some bytes for each object that is called "reported".
+TEST_F(SharesTest, timeAndTextCostTheirWriter) {
+  testing::FakeClock clock;
+  Throttle throttle(clock);
+  Spending spending;
+  const auto startCharged = [&](uint64_t seconds, uint64_t rowBytes) {
+    startAfresh();
+    limits.shares.nanoseconds = seconds * 1'000'000'000;
+    limits.shares.rowBytes = rowBytes;
+    extractor().chargeBy(clock, [&] {
+      return Spending{throttle.stepCount(), throttle.sleptTicks(), spending.rowBytes};
+    });
+  };
+  std::chrono::milliseconds rest{0};
+  answer = [&] {
+    throttle.throttleReportedEvent();
+    throttle.throttleReportedEvent();
+    clock.advance(rest);
+    spending.rowBytes += 100;
+    return true;
+  };
+  limits.shares.pairs = 1'000'000;
+  const std::string honest = "|_UID=2|TELEMETRY=1", junk = "|_UID=1|TELEMETRY=1";
+  startCharged(64, kNoLimit);
+  EXPECT_EQ(got(junk, 3000), 36'000u / 25) << "each step costs 12.5 ms, whichever one sleeps";
+  EXPECT_EQ(got(honest, 50), 50u);
+  rest = std::chrono::milliseconds{75};
+  startCharged(64, kNoLimit);
+  EXPECT_EQ(got(junk, 3000), 360u) << "what else the callback takes is added";
+  EXPECT_EQ(got("|_UID=3", 10), 10u);
+  EXPECT_EQ(got(junk, 7), 0u);
+  EXPECT_THAT(losses(), ElementsAre("2647 beyond_time_limit: too much of the time of a run "
+                                    "(user 1, unknown)"));
+  rest = std::chrono::hours{8};
+  startCharged(64, kNoLimit);
+  EXPECT_EQ(got(junk, 3), 3u) << "a machine that slept costs a sixteenth";
+  rest = {};
+  startCharged(1'000'000, 64'000);
+  EXPECT_EQ(got(junk, 3000), 360u);
+  EXPECT_EQ(got(honest, 50), 40u);
+  EXPECT_EQ(extractor().report().store.reading.losses.sum(LossCode::beyondTextLimit), 2650u);
 }
 
 TEST_F(JournalExtractorTest, anEarlyStopReturnsAtOnce) {
@@ -128,7 +225,8 @@ TEST_F(JournalExtractorTest, anEarlyStopReturnsAtOnce) {
   EXPECT_TRUE(extractor().processLogArchiveWithPath("/nowhere", Date{}, Date::max(), error));
   process({tracePoint("event")});
   EXPECT_THAT(delivered, IsEmpty());
-  EXPECT_TRUE(extractor().report().stopped);
+  EXPECT_TRUE(extractor().reading()->stopped);
+  EXPECT_EQ(extractor().reading()->unread(), extractor().reading()->rangeEnd);
 }
 
 TEST_F(JournalExtractorTest, aStopOrARefusalEndsTheCall) {
@@ -138,8 +236,13 @@ TEST_F(JournalExtractorTest, aStopOrARefusalEndsTheCall) {
       if (byStop && delivered.size() == 2) extractor().stopProcessing();
       return byStop || delivered.size() < 2;
     };
-    process({tracePoint("event"), tracePoint("event"), tracePoint("event")});
+    std::vector<FakeEntry> entries = {tracePoint("event"), tracePoint("event"),
+                                      tracePoint("event")};
+    entries[1].header.realtime = 7;
+    process(entries);
     EXPECT_EQ(delivered.size(), 2u) << byStop;
+    EXPECT_TRUE(extractor().report().stopped);
+    EXPECT_EQ(extractor().report().lastEntry, 7u);
   }
 }
 
@@ -181,6 +284,9 @@ TEST_F(JournalExtractorTest, aStoreIsReadWithinItsRange) {
                                                     start + std::chrono::microseconds(100), error));
   EXPECT_THAT(delivered, ElementsAre("Event 100", "Event 199"));
   EXPECT_EQ(extractor().processedEventCount(), 4u);
+  extractor().stopProcessing();
+  EXPECT_FALSE(extractor().reading()->stopped) << "a stop that comes after the end";
+  EXPECT_EQ(extractor().reading()->lastEntry, 199u);
   EXPECT_EQ(extractor().reading()->losses.sum(LossCode::malformed), 2u);
   EXPECT_THAT(log.lines(), Contains("Trace store: lost 2 malformed: missing TESSEL_SUBSYSTEM"));
 }

@@ -29,7 +29,8 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   if (!run.failure.empty()) json.member("failure", run.failure);
   json.member("log_events", run.logEvents).member("inspected", run.inspected);
   addVerdicts(json, run.classified);
-  json.member("unnamed", run.unnamed).member("count_events", run.countEvents);
+  json.member("unnamed", run.unnamed).member("unsendable", run.unsendable);
+  json.member("count_events", run.countEvents);
   json.member("rows_stored", run.rowsStored);
   // A run without books stores no row. The formula would still expect the row of the summary.
   json.member("rows_expected", hasBooks ? run.rowsExpected() : 0);
@@ -197,10 +198,11 @@ class Screen {
       plus = " + ";
     }
     balance("Objects", run.objectsBalance(), sums);
-    std::string rows = grouped(run.rowsStored) + " rows stored, expected 2 x " +
-                       grouped(run.reported()) +
-                       (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
-                       " + " + grouped(run.countEvents) + " counts + 1";
+    std::string rows =
+        grouped(run.rowsStored) + " rows stored, expected 2 x " + grouped(run.reported()) +
+        (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
+        (run.unsendable == 0 ? "" : " - 2 x " + grouped(run.unsendable) + " without a payload") +
+        " + " + grouped(run.countEvents) + " counts + 1";
     if (!run.rowsBalance()) rows += " = " + grouped(run.rowsExpected());
     balance("Rows", run.rowsBalance(), rows);
     for (const auto& [reason, count] : run.rowsFailed) {
@@ -222,9 +224,10 @@ class Screen {
       words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
     const std::string part = partOfPeriod(reading);
     // A store may be undamaged and yet too young for the period, so both must hold.
-    const bool whole = part.empty() && reading.losses.empty();
+    const bool whole = part.empty() && reading.losses.empty() && !reading.stopped;
     line("Store", whole ? "whole" : "not whole", whole ? Colour::good : Colour::caution, words);
     if (!part.empty()) more(part);
+    if (reading.stopped) more(unreadPart(reading));
     for (const std::string& loss : lossLines(reading.losses, kLossesOfACode)) more(loss);
   }
 

@@ -321,9 +321,11 @@ Html readingSection(const ExtractionReport& report, const ReportFacts& facts) {
 Html lossSection(const StoreReading& reading, std::string_view title, std::string_view id) {
   Html html;
   const std::string part = partOfPeriod(reading);
-  if (part.empty() && reading.losses.empty()) return html;
+  const std::string unread = unreadPart(reading);
+  if (part.empty() && unread.empty() && reading.losses.empty()) return html;
   html << "<section>\n<h2>" << title << "</h2>\n";
-  if (!part.empty()) html << "<p>" << part << ".</p>\n";
+  for (const std::string& sentence : {part, unread})
+    if (!sentence.empty()) html << "<p>" << sentence << ".</p>\n";
   html << "<div class=\"scroll\"><table id=\"" << id
        << "\"><tr><th class=\"n\">Lost</th><th>Why</th><th>Where</th></tr>\n";
   for (const Loss& loss : reading.losses.all()) {

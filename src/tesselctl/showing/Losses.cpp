@@ -37,7 +37,7 @@ void addLosses(JsonWriter& json, const Losses& losses) {
       json.member("code", lossName(loss.code)).member("count", loss.count);
       json.member("words", loss.words);
       if (!loss.place.name.empty()) json.member("place", loss.place.name);
-      json.member("offset", loss.place.offset);
+      json.member("offset", loss.place.offset).member("uid", loss.place.user);
       if (loss.places > 1) json.member("places", loss.places);
     });
   });
@@ -47,6 +47,23 @@ void addMalformed(JsonWriter& json, const Losses& losses) {
   json.object("malformed", [&] {
     for (const Loss& loss : toldApart(losses, LossCode::malformed))
       json.member(loss.words, loss.count);
+  });
+}
+
+void addOverShare(JsonWriter& json, const Losses& losses) {
+  // In the order of the codes, from openIntervalDropped on.
+  static constexpr std::string_view kWhat[] = {"open_intervals", "pairs", "images", "text", "time"};
+  std::vector<Loss> overShare = losses.all();
+  std::erase_if(overShare, [](const Loss& loss) { return !isOverShare(loss.code); });
+  json.array("over_share", overShare, [&](const Loss& loss) {
+    json.object([&] {
+      // The loss "other" sums up further writers, and the place is that of the first of them.
+      if (!loss.isOther()) json.member("uid", loss.place.user);
+      json.member("image", loss.isOther() ? loss.words : loss.place.name);
+      json.member("what", kWhat[static_cast<size_t>(loss.code) -
+                                static_cast<size_t>(LossCode::openIntervalDropped)]);
+      json.member("count", loss.count);
+    });
   });
 }
 
@@ -74,6 +91,8 @@ void addReading(JsonWriter& json, const StoreReading& reading) {
   json.object("intervals",
               [&] { json.member("dropped", losses.sum(LossCode::openIntervalDropped)); });
   addStore(json, reading);
+  addOverShare(json, losses);
+  json.member("stopped", reading.stopped).member("unread_microseconds", reading.unread());
   json.member("dropped_not_listed", losses.notListed(LossCode::droppedByDaemon));
   json.member("files_read", reading.filesRead);
   json.member("files_outside_range", reading.filesOutsideRange);
@@ -92,6 +111,12 @@ void addReading(JsonWriter& json, const StoreReading& reading) {
     });
   });
   addLosses(json, losses);
+}
+
+std::string unreadPart(const StoreReading& reading) {
+  if (!reading.stopped) return {};
+  return "The run was cut short: " + durationText(std::chrono::microseconds{reading.unread()}) +
+         " of its day were not read";
 }
 
 std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode) {

@@ -16,10 +16,16 @@ namespace tessel::ctl {
 // A sentence if the store holds only a part of the period, without its full stop; else empty.
 std::string partOfPeriod(const StoreReading& reading);
 
+// A sentence if a stop left a part of the period unread, without its full stop; else empty.
+std::string unreadPart(const StoreReading& reading);
+
 // Writes the member `losses`. All commands write it alike.
 void addLosses(JsonWriter& json, const Losses& losses);
 // Writes the member `malformed`: a count for each reason.
 void addMalformed(JsonWriter& json, const Losses& losses);
+// Writes the member `over_share`: what each writer lost because he had more than his share.
+// `losses` has the same counts, so they must not be added up.
+void addOverShare(JsonWriter& json, const Losses& losses);
 // Writes the members `beyond_pair_limit`, `without_exe` and `store`.
 void addStore(JsonWriter& json, const StoreReading& reading);
 // The members of a reading as `status --json` has it.

@@ -286,6 +286,7 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
     writeMisses(json, tally);
     writeIntervals(json, report.assembly);
     addStore(json, reading);
+    addOverShare(json, reading.losses);
     writeFiles(json, report.store);
     json.member("start", tally.period().start).member("end", tally.period().end);
     addLosses(json, reading.losses);

@@ -26,8 +26,12 @@ FakeEntry tracePoint(std::string_view text, uint64_t monotonic, uint8_t boot) {
   entry.header.bootId[0] = boot;
   entry.header.monotonic = monotonic;
   const size_t kindLength = text.find('|');
-  entry.fields = {"MESSAGE=tessel", "TESSEL_SUBSYSTEM=com.vantor.Calendar", "TESSEL_CATEGORY=View",
-                  "TESSEL_KIND=" + std::string(text.substr(0, kindLength))};
+  entry.fields = {"MESSAGE=tessel", "TESSEL_KIND=" + std::string(text.substr(0, kindLength))};
+  for (const std::string_view field : {"SUBSYSTEM=com.vantor.Calendar", "CATEGORY=View"}) {
+    const std::string name = "|" + std::string(field.substr(0, field.find('=') + 1));
+    if (text.find(name) == std::string_view::npos)
+      entry.fields.push_back("TESSEL_" + std::string(field));
+  }
   text.remove_prefix(kindLength == std::string_view::npos ? text.size() : kindLength + 1);
   while (!text.empty()) {
     const std::string_view field = text.substr(0, text.find('|'));

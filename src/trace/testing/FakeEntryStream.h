@@ -33,8 +33,9 @@ class FakeEntryStream final : public EntryStream {
 };
 
 // The fields of one entry, separated by '|', with what every trace point needs put in front:
-// "begin|NAME=Open|ATTRIBUTE=a=b" is a begin of com.vantor.Calendar/View. A name without a leading
-// underscore gets the prefix of trace points.
+// "begin|NAME=Open|ATTRIBUTE=a=b" is a begin of com.vantor.Calendar/View, and "|CATEGORY=a" makes
+// it one of com.vantor.Calendar/a. A name without a leading underscore gets the prefix of trace
+// points.
 FakeEntry tracePoint(std::string_view text, uint64_t monotonic = 0, uint8_t boot = 1);
 
 }  // namespace tessel::testing

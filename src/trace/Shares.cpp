@@ -1,0 +1,116 @@
+// The rule of the last quarter, and the books of what was given away.
+
+#include "trace/Shares.h"
+
+#include <algorithm>
+
+#include "platform/Invariant.h"
+
+namespace tessel {
+
+namespace {
+
+constexpr uint64_t threeQuarters(uint64_t whole) { return whole - whole / 4; }
+constexpr uint64_t sixteenth(uint64_t whole) { return whole / 16; }
+
+size_t sizeOf(StringRef text) { return text.textOr("").size(); }
+
+}  // namespace
+
+Shares::Shares(Writers& writers, const ShareLimits& limits)
+    : writers_(writers), limits_{limits.pairs,      limits.pairBytes, limits.images,
+                                 limits.imageBytes, limits.rowBytes,  limits.nanoseconds} {
+  for (size_t kind = 0; kind < kKinds; ++kind)
+    openToAll_[kind] = threeQuarters(threeQuarters(limits_[kind]));
+  scarce_ = openToAll_[kTime] == 0 || openToAll_[kRowBytes] == 0;
+}
+
+bool Shares::weighs(const ObjectOffer& offer) {
+  if (generation_ != offer.table.generation()) {
+    std::ranges::fill(recentPairs_, 0);
+    generation_ = offer.table.generation();
+  }
+  const Origin writer = offer.writer();
+  if (const auto reason = refusal(offer, writer)) {
+    writers_.lost(writers_.numberOf(writer), *reason);
+    ++refusals_;
+    return false;
+  }
+  recentPair(offer) = offer.pair();
+  return true;
+}
+
+// What an object costs in time and text shows only afterwards, so 1 stands for it here. One object
+// overdraws a share by little. Only an object that is marked for telemetry can be reported, and the
+// process remembers the executables of reported objects only. A pair is held by whoever brought it
+// first, and then serves everybody.
+std::optional<LossCode> Shares::refusal(const ObjectOffer& offer, const Origin& writer) {
+  if (!mayTake(kTime, 1, writer)) return LossCode::beyondTimeLimit;
+  if (!mayTake(kRowBytes, 1, writer)) return LossCode::beyondTextLimit;
+  for (const FieldToken image : offer.images()) {
+    if (!offer.telemetryEnabled() || offer.table.noted(image)) continue;
+    const StringRef path = offer.table.text(image);
+    if (!hasOrTakes(images_, {path.hash(), 0}, sizeOf(path), kImages, kImageBytes, writer))
+      return LossCode::beyondImageLimit;
+    offer.table.note(image);
+  }
+  const Key pair{offer.subsystem().hash(), offer.category().hash()};
+  const size_t bytes = sizeOf(offer.subsystem()) + sizeOf(offer.category());
+  if (!hasOrTakes(pairs_, pair, bytes, kPairs, kPairBytes, writer))
+    return LossCode::beyondPairLimit;
+  return std::nullopt;
+}
+
+bool Shares::hasOrTakes(Admitted& admitted, Key key, uint64_t bytes, Kind count, Kind text,
+                        const Origin& origin) {
+  // Both hashes are seeded, so the sum needs no seed. The odd factor keeps pairs of two equal
+  // texts, and pairs whose texts change places, apart.
+  const auto hash = static_cast<uint32_t>(key.first + key.second * 0x9e3779b97f4a7c15u);
+  const auto isKey = [&](uint32_t number) { return admitted.keys[number] == key; };
+  if (admitted.index.find(hash, isKey) != FlatIndex::kNone) return true;
+  if (!mayTake(count, 1, origin) || !mayTake(text, bytes, origin)) return false;
+  const uint32_t writer = writers_.numberOf(origin);
+  take(count, 1, writer);
+  take(text, bytes, writer);
+  admitted.index.add(hash, static_cast<uint32_t>(admitted.keys.size()));
+  admitted.keys.push_back(key);
+  return true;
+}
+
+// The rule, first among users and then among the programs of one. A user who holds little gets what
+// there is, so the programs of one user are weighed only against one another.
+bool Shares::mayTakeScarce(Kind kind, uint64_t amount, const Origin& origin) {
+  const uint64_t after = given_[kind] + amount;
+  if (after > limits_[kind]) return false;
+  const uint32_t writer = writers_.numberOf(origin);
+  const uint32_t user = writers_.userOf(writer);
+  const auto heldBy = [kind](const std::vector<Amounts>& all, uint32_t number) {
+    return number < all.size() ? all[number][kind] : 0;
+  };
+  if (heldBy(byUser_, user) + amount <= sixteenth(limits_[kind])) return true;
+  const uint64_t openToUsers = threeQuarters(limits_[kind]);
+  return after <= openToUsers && heldBy(byWriter_, writer) + amount <= sixteenth(openToUsers);
+}
+
+void Shares::take(Kind kind, uint64_t amount, uint32_t writer) {
+  const uint32_t user = writers_.userOf(writer);
+  if (byWriter_.size() <= writer) byWriter_.resize(writers_.size());
+  if (byUser_.size() <= user) byUser_.resize(writers_.users());
+  given_[kind] += amount;
+  byUser_[user][kind] += amount;
+  byWriter_[writer][kind] += amount;
+  // A user holds what his programs hold, and nobody holds what was not given away.
+  TESSEL_INVARIANT(byWriter_[writer][kind] <= byUser_[user][kind] &&
+                   byUser_[user][kind] <= given_[kind]);
+}
+
+// A machine that was asleep during one delivery must not cost everybody the rest of the run. So one
+// delivery costs its writer at most the sixteenth that ends his claim to what is scarce.
+void Shares::charge(const Origin& origin, uint64_t rowBytes, uint64_t nanoseconds) {
+  const uint32_t writer = writers_.numberOf(origin);
+  take(kRowBytes, rowBytes, writer);
+  take(kTime, std::min(nanoseconds, sixteenth(limits_[kTime])), writer);
+  scarce_ = given_[kTime] >= openToAll_[kTime] || given_[kRowBytes] >= openToAll_[kRowBytes];
+}
+
+}  // namespace tessel
