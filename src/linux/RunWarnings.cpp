@@ -6,8 +6,6 @@
 #include "linux/RunWarnings.h"
 
 #include <algorithm>
-#include <array>
-#include <numeric>
 
 #include "platform/Log.h"
 #include "platform/Text.h"
@@ -23,21 +21,23 @@ constexpr size_t kMaxTextBytes = 256;
 // a file.
 constexpr size_t kMaxOfAKind = 16;
 
-// Losses whose code is not here cost nobody a trace point: a point whose executable is unknown is
-// reported under another name.
+// Codes that stand side by side and have one reason share a line. Losses whose code is not here
+// cost nobody a trace point: a point whose executable is unknown is reported under another name.
 constexpr struct {
-  LossCode code;
-  std::string_view warning;  // codes with the same warning are summed up in one line
+  LossCode first, last;
+  std::string_view warning;
   std::string_view beginning;
 } kLossWarnings[] = {
-    {LossCode::fileSkipped, "store_unreadable", "Files of the trace store were not read: "},
-    {LossCode::filesNotLookedAt, "store_unreadable", "Files of the trace store were not read: "},
-    {LossCode::fileDamaged, "store_damaged", "The trace store is damaged: "},
-    {LossCode::droppedByDaemon, "dropped_by_daemon", "The journal daemon dropped entries: "},
-    {LossCode::entriesMissing, "numbers_in_no_file", "Entries are in no file of the trace store: "},
-    {LossCode::malformed, "malformed", "Trace points were malformed: "},
-    {LossCode::openIntervalDropped, "over_share", "Writers had more than their share: "},
-    {LossCode::beyondPairLimit, "over_share", "Writers had more than their share: "},
+    {LossCode::fileSkipped, LossCode::filesNotLookedAt, "store_unreadable",
+     "Files of the trace store were not read: "},
+    {LossCode::fileDamaged, LossCode::fileDamaged, "store_damaged", "The trace store is damaged: "},
+    {LossCode::droppedByDaemon, LossCode::droppedByDaemon, "dropped_by_daemon",
+     "The journal daemon dropped entries: "},
+    {LossCode::entriesMissing, LossCode::entriesMissing, "numbers_in_no_file",
+     "Entries are in no file of the trace store: "},
+    {LossCode::malformed, LossCode::malformed, "malformed", "Trace points were malformed: "},
+    {LossCode::openIntervalDropped, static_cast<LossCode>(kLossCodes - 1), "over_share",
+     "Writers had more than their share: "},
 };
 
 std::string escaped(std::string_view text) { return shortPlainText(text, kMaxTextBytes); }
@@ -96,22 +96,17 @@ std::string example(const Loss& loss) {
 }
 
 void addLosses(std::vector<RunWarning>& warnings, const Losses& losses) {
-  uint64_t count = 0;
-  const Loss* first = nullptr;
-  for (size_t at = 0; at < std::size(kLossWarnings); ++at) {
-    const auto& row = kLossWarnings[at];
-    const auto listed = std::ranges::find(losses.all(), row.code, &Loss::code);
-    if (listed != losses.all().end()) {
-      count += losses.sum(row.code);
-      if (first == nullptr) first = &*listed;
+  for (const auto& row : kLossWarnings) {
+    uint64_t count = 0;
+    const Loss* first = nullptr;  // the list is sorted by code
+    for (const Loss& loss : losses.all()) {
+      if (loss.code < row.first || loss.code > row.last) continue;
+      count += loss.count;
+      if (first == nullptr) first = &loss;
     }
-    const bool summed =
-        at + 1 < std::size(kLossWarnings) && kLossWarnings[at + 1].warning == row.warning;
-    if (summed || first == nullptr) continue;
+    if (first == nullptr) continue;
     warnings.push_back({row.warning, std::string(row.beginning) + std::to_string(count) +
                                          "; the first: " + example(*first)});
-    count = 0;
-    first = nullptr;
   }
 }
 

@@ -72,6 +72,16 @@ TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
   }
 }
 
+TEST(RunWarningsTest, EveryLossButAnUnknownImageIsOne) {
+  for (size_t code = 0; code < kLossCodes; ++code) {
+    RunRecord record;
+    record.rowsStored = record.rowsExpected();
+    record.reading.emplace().losses.add(static_cast<LossCode>(code), "words", {});
+    const size_t expected = static_cast<LossCode>(code) == LossCode::noImagePath ? 0 : 1;
+    EXPECT_EQ(runWarnings(record).size(), expected) << lossName(static_cast<LossCode>(code));
+  }
+}
+
 TEST(RunWarningsTest, LossesOfACodeAreSummedUp) {
   RunRecord record;
   record.rowsStored = record.rowsExpected();
