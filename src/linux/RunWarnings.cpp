@@ -49,6 +49,14 @@ std::string joined(const std::vector<std::string>& names) {
   return escaped(list);
 }
 
+std::string unreadWords(const RunRecord& record) {
+  if (!record.reading) return "its day was not read to the end";
+  constexpr uint64_t kMinute = 60'000'000;
+  // Rounded up: a minute that was read in part was not read.
+  const uint64_t minutes = (record.reading->unread() + kMinute - 1) / kMinute;
+  return "the last " + std::to_string(minutes) + " minutes of its day were not read";
+}
+
 void addOutcome(std::vector<RunWarning>& warnings, const RunRecord& record) {
   if (record.outcome == RunOutcome::failed) {
     warnings.push_back({"run_failed", "The run failed: " + escaped(record.failure)});
@@ -57,9 +65,7 @@ void addOutcome(std::vector<RunWarning>& warnings, const RunRecord& record) {
                         "The run read nothing, because an earlier run died: the run "
                         "marker was there when it began"});
   } else if (record.outcome == RunOutcome::interrupted) {
-    warnings.push_back({"run_cut_short",
-                        "The run was cut short: it was asked to stop before its "
-                        "day was read to the end"});
+    warnings.push_back({"run_cut_short", "The run was cut short: " + unreadWords(record)});
   }
   if (record.marker == "still there") {
     warnings.push_back({"marker_stuck",

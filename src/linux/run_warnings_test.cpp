@@ -30,6 +30,9 @@ RunRecord worstRun() {
                                    1);
   record.setAside = std::vector<std::string>(300, std::string(4096, '\n'));
   record.reading.emplace();
+  record.reading->stopped = true;
+  record.reading->rangeEnd = 90'000'000;
+  record.reading->lastEntry = 0;
   for (size_t code = 0; code < kLossCodes; ++code) {
     for (int writer = 0; writer < 300; ++writer) {
       record.reading->losses.add(static_cast<LossCode>(code), std::string(4096, '\x9b'),
@@ -52,6 +55,8 @@ TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
   RunRecord record = worstRun();
   auto codes = codesOf(record);
   EXPECT_EQ(std::ranges::count(codes, "rows_refused"), 16);
+  EXPECT_EQ(runWarnings(record)[0].text,
+            "The run was cut short: the last 2 minutes of its day were not read");
   codes.erase(std::unique(codes.begin(), codes.end()), codes.end());
   EXPECT_THAT(codes, ::testing::ElementsAre("run_cut_short", "marker_stuck", "rows_refused",
                                             "books_unbalanced", "spool_damaged", "store_unreadable",
