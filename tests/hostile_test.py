@@ -64,7 +64,7 @@ class Flood(MachineTest):
         summary = json.loads(self.assert_clean(self.machine.ctl("explain", "--summary", "--json")).out)
         self.assertEqual(summary["over_share"], [{"uid": HOSTILE, "image": "/opt/flood", "what": "pairs",
                                                   "count": POINTS - delivered}] if POINTS > delivered else [])
-        said = [line for line in log if "too many pairs of subsystem and category" in line]
+        said = [line for line in log if "Trace store: lost" in line and "too many pairs of subsystem and category" in line]
         self.assertEqual(len(said), 1 if POINTS > delivered else 0)
         if said:
             self.assertIn(f"lost {POINTS - delivered} beyond_pair_limit", said[0])

@@ -149,10 +149,9 @@ void OpenIntervals::release(uint32_t number) {
   node.older = std::exchange(free_, number);
 }
 
-// New tokens give each key a new hash, so we build the index anew. We serve the writers in the
-// order of what they took so far, so that the room is shared like water in vessels: whoever needs
-// little gets all of it, and the others get equal parts. Texts that two writers share count for the
-// first one only.
+// New tokens give each key a new hash, so we build the index anew. The writer who took least so far
+// is served next. So whoever needs little gets all of it, and the others get equal parts of the
+// rest. A text that two writers share counts only for the one who is served first.
 void OpenIntervals::renewAll(const std::function<std::optional<size_t>(OpenInterval&)>& renew) {
   index_.clear();
   Turns turns(writers_);

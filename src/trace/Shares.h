@@ -10,7 +10,7 @@
 // sixteenths of a total suffice for everybody, nobody is refused anything.
 //
 // We discarded equal parts for all, because nobody knows beforehand how many writers will come. We
-// discarded to order a day by writer before it is delivered, because a day does not fit into
+// discarded sorting the day by writer before anything is delivered, because a day does not fit into
 // memory.
 //
 // Threads: one at a time.
@@ -34,9 +34,10 @@ namespace tessel {
 
 inline constexpr uint64_t kNoLimit = std::numeric_limits<uint64_t>::max();
 
-// At its end a run spends time and memory on each (subsystem, category) pair, and the process keeps
-// a note of each executable for as long as it lives. A writer may make up any number of either. A
-// machine full of programs has fewer than 4,096 of both. 4 MiB of text leave 1 KiB for each.
+// At its end a run spends time and memory on each (subsystem, category) pair. For each executable
+// the process looks for a bundle, and remembers what it found. A writer may make up any number of
+// either. A machine full of programs has fewer than 4,096 of both. 4 MiB of text leave 1 KiB for
+// each.
 struct ShareLimits {
   uint64_t pairs = 4096;
   uint64_t pairBytes = uint64_t{4} << 20;  // of all subsystems and categories together
