@@ -16,7 +16,7 @@ namespace {
 
 // A path of the journal takes some 100 bytes. With 256 for each foreign text a line stays below
 // 1 KiB, so the journal keeps it whole and a terminal shows it on a few rows.
-constexpr size_t kMaxTextBytes = 256;
+constexpr size_t kMaxForeignTextBytes = 256;
 // A run knows fewer reasons and set-aside files. The bound matters for a record that was read from
 // a file.
 constexpr size_t kMaxOfAKind = 16;
@@ -40,7 +40,7 @@ constexpr struct {
      "Writers had more than their share: "},
 };
 
-std::string escaped(std::string_view text) { return shortPlainText(text, kMaxTextBytes); }
+std::string escaped(std::string_view text) { return shortPlainText(text, kMaxForeignTextBytes); }
 
 std::string joined(const std::vector<std::string>& names) {
   std::string list;

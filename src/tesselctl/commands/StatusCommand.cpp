@@ -97,6 +97,8 @@ std::string statusJson(const ReporterStatus& status) {
       json.member("wanted", status.deferral.has_value()).member("reason", status.deferral);
     });
     json.object("marker", [&] { writeMarkers(json, status.markers); });
+    json.array("refused_files", status.refusedFiles,
+               [&](const PlatformError& error) { json.value(error.words); });
     if (status.run)
       json.object("last_run", [&] { writeRun(json, *status.run, status.hasBooks()); });
     json.member("last_begin", status.lastBegin);
