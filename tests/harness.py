@@ -178,6 +178,11 @@ class Machine:
     def marker_exists(self):
         return os.path.lexists(os.path.join(self.var_tmp, MARKER))
 
+    def record(self):
+        """What the last run came to."""
+        with open(os.path.join(self.state, "last_run.json"), encoding="utf-8") as file:
+            return json.load(file)
+
     def rows(self):
         """(name, payload as a list of pairs) of each row of the spool, in order."""
         path = os.path.join(self.state, "statora.db")

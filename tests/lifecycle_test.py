@@ -6,7 +6,7 @@ import sqlite3
 import time
 
 import harness
-from harness import STATISTICS, MachineTest, interrupt, point, some_points, wait_for
+from harness import STATISTICS, Machine, MachineTest, interrupt, point, some_points, wait_for
 
 
 class Launch(MachineTest):
@@ -59,18 +59,57 @@ class Deferral(MachineTest):
         self.assertEqual(result.log[:2], ["Checking in", "Deferred tessel_reporter"])
         self.assertEqual(self.machine.rows()[-1][0], STATISTICS)
 
-    def test_a_deferral_in_the_middle_stops_the_run(self):
-        self.machine.write_journal(some_points(3000))
-        process = self.machine.start()
-        wait_for(lambda: self.machine.rows())
-        open(os.path.join(self.machine.state, "defer"), "w", encoding="utf-8").close()
-        result = self.assert_clean(self.machine.result(process))
+    def test_the_defer_file_and_the_run_limit_stop_a_run(self):
+        """Either ends a run well: what was read is reported and summed up, and the marker is gone."""
+        limited = Machine()
+        self.addCleanup(limited.close)
+        limited.task()
+        deferred = self.machine
+        for machine in (deferred, limited):
+            machine.write_journal(some_points(3000))
+        processes = [deferred.start(TESSEL_RUN_LIMIT="0"), limited.start(TESSEL_RUN_LIMIT="3")]
+        wait_for(deferred.rows)
+        wish = os.path.join(deferred.state, "defer")
+        open(wish, "w", encoding="utf-8").close()
+        for machine, process, reason in ((deferred, processes[0], f"{wish} exists"),
+                                         (limited, processes[1], "it has taken as long as TESSEL_RUN_LIMIT allows")):
+            result = self.assert_clean(machine.result(process))
+            rows = machine.rows()
+            statistics = dict(rows[-1][1])
+            self.assertTrue(statistics["WasInterrupted"])
+            self.assertLess(statistics["EventsReported"], 3000)
+            self.assertEqual(sum(name == "com.vantor.performance.tessel" for name, _ in rows), statistics["EventsReported"])
+            self.assertTrue(any(line.endswith(" (Interrupted by deferral)") for line in result.log))
+            why, what = result.warnings
+            self.assertEqual(why, f"The run is stopped early: {reason}")
+            self.assertTrue(what.startswith("The run was cut short"), what)
+            self.assertEqual(machine.record()["outcome"], "interrupted")
+            self.assertFalse(machine.marker_exists())
+
+    def test_pressure_puts_a_run_off_for_a_time_and_never_stops_it(self):
+        self.machine.write_journal(some_points(30))
+        pressure = os.path.join(self.machine.root, "cpu")
+        with open(pressure, "w", encoding="utf-8") as file:
+            file.write("some avg10=99.00 avg60=99.00 avg300=99.00 total=1\n")
+        process = self.machine.start("/bin/sh", "-c", 'mount -n --bind "$0" /proc/pressure/cpu && exec "$@"', pressure,
+                                     os.path.join(harness.BIN, "tessel_reporter"),
+                                     TESSEL_DEFER_ON="pressure", TESSEL_DEFER_LIMIT="3", TESSEL_DEFER_RETRY="2")
+        result = self.assert_clean(self.machine.result(process, 60))
+        self.assertEqual(result.log.count("Deferred tessel_reporter"), 2)
+        self.assertEqual(result.warnings, ["The run is put off: the CPU is under pressure"])
         statistics = dict(self.machine.rows()[-1][1])
-        self.assertTrue(statistics["WasInterrupted"])
-        self.assertLess(statistics["EventsReported"], 3000)
-        self.assertTrue(any(line.endswith(" (Interrupted by deferral)") for line in result.log))
-        self.assertTrue(any(line.startswith("The run was cut short") for line in result.warnings), result.errors)
+        self.assertEqual((statistics["EventsReported"], statistics["WasInterrupted"]), (30, False))
+
+
+class FileSize(MachineTest):
+    def test_a_file_that_may_not_grow_costs_rows_alone(self):
+        self.machine.write_journal(some_points(300))
+        process = self.machine.start("/usr/bin/prlimit", "--fsize=300000", os.path.join(harness.BIN, "tessel_reporter"),
+                                     TESSEL_LOG_LEVEL="error")
+        self.assert_clean(self.machine.result(process))
         self.assertFalse(self.machine.marker_exists())
+        record = self.machine.record()
+        self.assertGreater(sum(record["rows_failed"].values()), 0, record)
 
 
 class TwoProcesses(MachineTest):

@@ -3,7 +3,9 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <atomic>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/Queues.h"
@@ -42,6 +44,78 @@ TEST(WorkerQueueTest, ADroppedQueueRunsWhatItHolds) {
     queue.async([done] { done->signal(); });
   }
   EXPECT_TRUE(done->waitFor(std::chrono::seconds(30)));
+}
+
+// A closure that waits until the test opens the gate.
+struct Gate {
+  void pass() {
+    const int now = ++inside;
+    int most = mostInside;
+    while (most < now && !mostInside.compare_exchange_weak(most, now)) {
+    }
+    entered.signal();
+    EXPECT_TRUE(open.waitFor(std::chrono::seconds(30)));
+    --inside;
+    left.signal();
+  }
+
+  Semaphore entered{0};
+  Semaphore open{0};
+  Semaphore left{0};
+  std::atomic<int> inside{0};
+  std::atomic<int> mostInside{0};
+};
+
+TEST(WorkerQueueTest, QueuesShareEightThreadsAndOwnOnesDoNotWait) {
+  constexpr int kQueues = 30;
+  constexpr int kThreads = 8;
+  const auto gate = std::make_shared<Gate>();
+  for (int i = 0; i < kQueues; ++i) WorkerQueue("shared").async([gate] { gate->pass(); });
+  for (int i = 0; i < kThreads; ++i) ASSERT_TRUE(gate->entered.waitFor(std::chrono::seconds(30)));
+  EXPECT_FALSE(gate->entered.waitFor(std::chrono::milliseconds(50))) << "a ninth thread";
+  bool ran = false;
+  WorkerQueue("own", QueueThread::own).sync([&ran] { ran = true; });
+  EXPECT_TRUE(ran);
+  for (int i = 0; i < kQueues; ++i) gate->open.signal();
+  for (int i = 0; i < kQueues; ++i) EXPECT_TRUE(gate->left.waitFor(std::chrono::seconds(30)));
+  EXPECT_EQ(gate->mostInside, kThreads);
+}
+
+TEST(WorkerQueueDeathTest, ASharedThreadMayNotWaitForAnotherQueue) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(
+      {
+        WorkerQueue other("other");
+        Semaphore never(0);
+        WorkerQueue("shared").async([&other] { other.sync([] {}); });
+        never.waitFor(std::chrono::seconds(30));
+      },
+      "broken invariant at Queues.cpp");
+}
+
+// A queue that keeps what it is given until the test runs it.
+struct StuckQueue final : SerialQueue {
+  const std::string& label() const override { return name; }
+  void async(Closure work) override {
+    held = std::move(work);
+    submitted.signal();
+  }
+  void sync(const Closure&) override {}
+
+  const std::string name = "stuck";
+  Closure held;
+  Semaphore submitted{0};
+};
+
+TEST(RepeatingTimerTest, AFiringThatStillWaitsIsNotRepeated) {
+  WorkerQueueFactory factory;
+  const auto queue = std::make_shared<StuckQueue>();
+  const std::chrono::milliseconds often(1);
+  factory.makeRepeatingTimer(queue, often, often, [] {})->resume();
+  EXPECT_TRUE(queue->submitted.waitFor(std::chrono::seconds(30)));
+  EXPECT_FALSE(queue->submitted.waitFor(50 * often));
+  std::exchange(queue->held, nullptr)();
+  EXPECT_TRUE(queue->submitted.waitFor(std::chrono::seconds(30)));
 }
 
 TEST(RepeatingTimerTest, FiresAtOnceAndOutlivesItsOwner) {
