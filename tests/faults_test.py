@@ -11,6 +11,7 @@ import os
 import random
 import shutil
 import signal
+import socket
 import sqlite3
 import subprocess
 import time
@@ -177,6 +178,37 @@ class Disk(FaultTest):
         self.assertFalse(machine.marker_exists())
         machine.forget_state()
         self.assert_next_run_reports(machine)
+
+
+class Watchdog(MachineTest):
+    def test_a_wait_is_a_sign_of_life_for_a_minute(self):
+        """Reading hangs in a journalctl that never answers. The clocks are hurried on, so a minute is soon over."""
+        path = self.machine.write_journal(some_points(1))
+        with open(path, "r+b") as file:
+            file.seek(15)  # among the flags that a reader must know
+            file.write(b"\x40")
+        tools = os.path.join(self.machine.root, "tools")
+        os.mkdir(tools)
+        with open(os.path.join(tools, "journalctl"), "w", encoding="utf-8") as file:
+            file.write("#!/bin/sh\nexec tail --pid=$PPID -f /dev/null\n")
+        os.chmod(file.name, 0o755)
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as manager:
+            manager.bind(os.path.join(self.machine.root, "notify"))
+            manager.settimeout(60)
+            process = self.machine.start(**FaultMachine.faults(HURRY="1"), PATH=tools + ":" + os.environ["PATH"],
+                                         NOTIFY_SOCKET=manager.getsockname(), WATCHDOG_USEC="15000000")
+            self.addCleanup(process.kill)
+            while manager.recv(4096) != b"STATUS=reading the trace store":
+                pass
+            manager.settimeout(6)  # the first wait of the main loop is too long to be hurried; all others are
+            signs = 0
+            with contextlib.suppress(TimeoutError):
+                while True:
+                    signs += manager.recv(4096) == b"WATCHDOG=1"
+        self.assertIsNone(process.poll())
+        self.assertIn(signs, range(13, 18), "one each 3.75 s for a minute, and no more")
+        interrupt(process)
+        self.assert_clean(self.machine.result(process))
 
 
 class Threads(unittest.TestCase):
