@@ -227,7 +227,7 @@ class Threads(unittest.TestCase):
                                 os.path.join(BIN, "tessel_reporter"),
                                 **FaultMachine.faults(HURRY="1"), TESSEL_ACTIVITY_INTERVAL="2", TESSEL_LOG_LEVEL="error")
         self.addCleanup(process.kill)
-        wait_for(lambda: process.poll() is not None or runs_of(machine) > 250)
+        wait_for(lambda: process.poll() is not None or runs_of(machine) > 250, 300)
         process.send_signal(signal.SIGSTOP)
         time.sleep(11)  # each poll comes every ten seconds
         process.send_signal(signal.SIGCONT)
