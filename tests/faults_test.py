@@ -5,20 +5,16 @@ There are many places where a call can fail; by default the tests take a sample.
 every place. TESSEL_RANDOM_KILLS is the number of random moments at which the process is killed.
 """
 import concurrent.futures
-import contextlib
 import errno
 import os
 import random
 import shutil
-import signal
-import socket
-import sqlite3
 import subprocess
 import time
 import unittest
 
 import harness
-from harness import (BIN, STATISTICS, Machine, MachineTest, in_namespace_argv, interrupt, log_event, point, some_points,
+from harness import (BIN, STATISTICS, MachineTest, in_namespace_argv, interrupt, log_event, point, some_points,
                      wait_for)
 from faults.fault_machine import BAILED, STEPS, FaultMachine, NeverInjected, Watcher, is_subsequence
 
@@ -178,77 +174,6 @@ class Disk(FaultTest):
         self.assertFalse(machine.marker_exists())
         machine.forget_state()
         self.assert_next_run_reports(machine)
-
-
-class Watchdog(MachineTest):
-    def test_a_wait_is_a_sign_of_life_for_a_minute(self):
-        """Reading hangs in a journalctl that never answers. The clocks are hurried on, so a minute is soon over."""
-        path = self.machine.write_journal(some_points(1))
-        with open(path, "r+b") as file:
-            file.seek(15)  # among the flags that a reader must know
-            file.write(b"\x40")
-        tools = os.path.join(self.machine.root, "tools")
-        os.mkdir(tools)
-        with open(os.path.join(tools, "journalctl"), "w", encoding="utf-8") as file:
-            file.write("#!/bin/sh\nexec tail --pid=$PPID -f /dev/null\n")
-        os.chmod(file.name, 0o755)
-        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as manager:
-            manager.bind(os.path.join(self.machine.root, "notify"))
-            manager.settimeout(60)
-            process = self.machine.start(**FaultMachine.faults(HURRY="1"), PATH=tools + ":" + os.environ["PATH"],
-                                         NOTIFY_SOCKET=manager.getsockname(), WATCHDOG_USEC="15000000")
-            self.addCleanup(process.kill)
-            while manager.recv(4096) != b"STATUS=reading the trace store":
-                pass
-            manager.settimeout(6)  # the first wait of the main loop is too long to be hurried; all others are
-            signs = 0
-            with contextlib.suppress(TimeoutError):
-                while True:
-                    signs += manager.recv(4096) == b"WATCHDOG=1"
-        self.assertIsNone(process.poll())
-        self.assertIn(signs, range(13, 18), "one each 3.75 s for a minute, and no more")
-        interrupt(process)
-        self.assert_clean(self.machine.result(process))
-
-
-class Threads(unittest.TestCase):
-    def test_many_polls_at_once_and_few_threads_to_be_had(self):
-        """A process that was stopped finds the polls of all its past runs due."""
-        harness.require_root()
-        machine = Machine()
-        self.addCleanup(machine.close)
-        machine.task()
-        machine.write_export([point("event", "com.vantor.Calendar", "View", "Open")])
-        for path, mode in ((machine.root, 0o755), (machine.var_tmp, 0o777)):
-            os.chmod(path, mode)
-        user = 54321  # who runs nothing else, because the limit counts all threads of a user
-        os.chown(machine.state, user, user)
-        process = machine.start("/usr/bin/setpriv", f"--reuid={user}", "--clear-groups", "prlimit", "--nproc=24",
-                                os.path.join(BIN, "tessel_reporter"),
-                                **FaultMachine.faults(HURRY="1"), TESSEL_ACTIVITY_INTERVAL="2", TESSEL_LOG_LEVEL="error")
-        self.addCleanup(process.kill)
-        wait_for(lambda: process.poll() is not None or runs_of(machine) > 250, 300)
-        process.send_signal(signal.SIGSTOP)
-        time.sleep(11)  # each poll comes every ten seconds
-        process.send_signal(signal.SIGCONT)
-        before = runs_of(machine)
-        most = 0
-        while process.poll() is None and runs_of(machine) < before + 20:
-            with contextlib.suppress(FileNotFoundError):
-                most = max(most, len(os.listdir(f"/proc/{process.pid}/task")))
-        interrupt(process)
-        result = machine.result(process)
-        self.assertEqual((result.status, result.errors), (0, ""), "it must go on as before")
-        self.assertLess(most, 24, "the limit itself must not be what keeps the threads few")
-
-
-def runs_of(machine):
-    """How many runs are over. Reads only: this user is another than that of the service."""
-    try:
-        with contextlib.closing(sqlite3.connect(f"file:{machine.state}/statora.db?mode=ro", uri=True)) as database:
-            return database.execute("SELECT count(*) FROM events WHERE name = ?", (STATISTICS,)).fetchone()[0]
-    except sqlite3.OperationalError:
-        return 0  # not made yet, or just being written
 
 
 class Clock(FaultTest):

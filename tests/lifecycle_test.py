@@ -1,12 +1,34 @@
 #!/usr/bin/env python3
-"""The life of the process: launch configuration, check-in, deferral, interrupt, two processes at a time."""
+"""The life of the process: launch configuration, check-in, deferral, interrupt, watchdog, limits of the system,
+two processes at a time."""
+import contextlib
 import os
 import random
+import signal
+import socket
 import sqlite3
 import time
 
 import harness
 from harness import STATISTICS, Machine, MachineTest, interrupt, point, some_points, wait_for
+from faults.fault_machine import FaultMachine
+
+
+def endless_journal(machine, points):
+    """A journal file that only a newer journalctl can read, and a journalctl that prints the points and then nothing
+    more, without an end. Answers the environment in which it is found."""
+    path = machine.write_journal(some_points(1))
+    with open(path, "r+b") as file:
+        file.seek(15)  # among the flags that a reader must know
+        file.write(b"\x40")
+    tools = os.path.join(machine.root, "tools")
+    os.mkdir(tools)
+    with open(os.path.join(tools, "points"), "wb") as file:
+        file.writelines(harness.export_bytes(points, machine.now))
+    with open(os.path.join(tools, "journalctl"), "w", encoding="utf-8") as file:
+        file.write(f"#!/bin/sh\nexec tail --pid=$PPID --lines=+1 -f {tools}/points\n")
+    os.chmod(file.name, 0o755)
+    return {"PATH": tools + ":" + os.environ["PATH"]}
 
 
 class Launch(MachineTest):
@@ -61,32 +83,31 @@ class Deferral(MachineTest):
 
     def test_the_defer_file_and_the_run_limit_stop_a_run(self):
         """Either ends a run well: what was read is reported and summed up, and the marker is gone."""
-        limited = Machine()
+        deferred, limited = self.machine, Machine()
         self.addCleanup(limited.close)
         limited.task()
-        deferred = self.machine
-        for machine in (deferred, limited):
-            machine.write_journal(some_points(3000))
-        processes = [deferred.start(TESSEL_RUN_LIMIT="0"), limited.start(TESSEL_RUN_LIMIT="3")]
+        deferred.write_journal(some_points(3000))
+        tools = endless_journal(limited, some_points(20))
+        processes = [deferred.start(TESSEL_RUN_LIMIT="0"), limited.start(TESSEL_RUN_LIMIT="3", **tools)]
         wait_for(deferred.rows)
         wish = os.path.join(deferred.state, "defer")
         open(wish, "w", encoding="utf-8").close()
-        for machine, process, reason in ((deferred, processes[0], f"{wish} exists"),
-                                         (limited, processes[1], "it has taken as long as TESSEL_RUN_LIMIT allows")):
+        for machine, process, most, reason in (
+                (deferred, processes[0], 2999, f"{wish} exists"),
+                (limited, processes[1], 20, "it has taken as long as TESSEL_RUN_LIMIT allows")):
             result = self.assert_clean(machine.result(process))
             rows = machine.rows()
             statistics = dict(rows[-1][1])
-            self.assertTrue(statistics["WasInterrupted"])
-            self.assertLess(statistics["EventsReported"], 3000)
+            self.assertTrue(statistics["WasInterrupted"], result.errors)
+            self.assertIn(statistics["EventsReported"], range(1, most + 1))
             self.assertEqual(sum(name == "com.vantor.performance.tessel" for name, _ in rows), statistics["EventsReported"])
             self.assertTrue(any(line.endswith(" (Interrupted by deferral)") for line in result.log))
-            why, what = result.warnings
-            self.assertEqual(why, f"The run is stopped early: {reason}")
-            self.assertTrue(what.startswith("The run was cut short"), what)
+            self.assertEqual(result.warnings[0], f"The run is stopped early: {reason}")
+            self.assertTrue(any(line.startswith("The run was cut short") for line in result.warnings), result.warnings)
             self.assertEqual(machine.record()["outcome"], "interrupted")
             self.assertFalse(machine.marker_exists())
 
-    def test_pressure_puts_a_run_off_for_a_time_and_never_stops_it(self):
+    def test_pressure_puts_a_run_off_and_never_stops_it(self):
         self.machine.write_journal(some_points(30))
         pressure = os.path.join(self.machine.root, "cpu")
         with open(pressure, "w", encoding="utf-8") as file:
@@ -110,6 +131,67 @@ class FileSize(MachineTest):
         self.assertFalse(self.machine.marker_exists())
         record = self.machine.record()
         self.assertGreater(sum(record["rows_failed"].values()), 0, record)
+
+
+class Watchdog(MachineTest):
+    def test_a_wait_is_a_sign_of_life_for_a_minute(self):
+        """Reading hangs in a journalctl that never answers. The clocks are hurried on, so a minute is soon over."""
+        tools = endless_journal(self.machine, [])
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as manager:
+            manager.bind(os.path.join(self.machine.root, "notify"))
+            manager.settimeout(60)
+            process = self.machine.start(**FaultMachine.faults(HURRY="1"), **tools,
+                                         NOTIFY_SOCKET=manager.getsockname(), WATCHDOG_USEC="15000000")
+            self.addCleanup(process.kill)
+            while manager.recv(4096) != b"STATUS=reading the trace store":
+                pass
+            manager.settimeout(6)  # the first wait of the main loop is too long to be hurried; all others are
+            signs = 0
+            with contextlib.suppress(TimeoutError):
+                while True:
+                    signs += manager.recv(4096) == b"WATCHDOG=1"
+        self.assertIsNone(process.poll())
+        self.assertIn(signs, range(13, 18), "one each 3.75 s for a minute, and no more")
+        interrupt(process)
+        self.assert_clean(self.machine.result(process))
+
+
+class Threads(MachineTest):
+    def test_many_polls_at_once_and_few_threads_to_be_had(self):
+        """A process that was stopped finds the polls of all its past runs due."""
+        harness.require_root()
+        machine = self.machine
+        machine.write_export([point("event", "com.vantor.Calendar", "View", "Open")])
+        for path, mode in ((machine.root, 0o755), (machine.var_tmp, 0o777)):
+            os.chmod(path, mode)
+        user = 54321  # who runs nothing else, because the limit counts all threads of a user
+        os.chown(machine.state, user, user)
+        process = machine.start("/usr/bin/setpriv", f"--reuid={user}", "--clear-groups", "prlimit", "--nproc=24",
+                                os.path.join(harness.BIN, "tessel_reporter"),
+                                **FaultMachine.faults(HURRY="1"), TESSEL_ACTIVITY_INTERVAL="2", TESSEL_LOG_LEVEL="error")
+        self.addCleanup(process.kill)
+        wait_for(lambda: process.poll() is not None or runs_of(machine) > 250, 300)
+        process.send_signal(signal.SIGSTOP)
+        time.sleep(11)  # each poll comes every ten seconds
+        process.send_signal(signal.SIGCONT)
+        before = runs_of(machine)
+        most = 0
+        while process.poll() is None and runs_of(machine) < before + 20:
+            with contextlib.suppress(FileNotFoundError):
+                most = max(most, len(os.listdir(f"/proc/{process.pid}/task")))
+        interrupt(process)
+        result = machine.result(process)
+        self.assertEqual((result.status, result.errors), (0, ""), "it must go on as before")
+        self.assertLess(most, 24, "the limit itself must not be what keeps the threads few")
+
+
+def runs_of(machine):
+    """How many runs are over. Reads only: this user is another than that of the service."""
+    try:
+        with contextlib.closing(sqlite3.connect(f"file:{machine.state}/statora.db?mode=ro", uri=True)) as database:
+            return database.execute("SELECT count(*) FROM events WHERE name = ?", (STATISTICS,)).fetchone()[0]
+    except sqlite3.OperationalError:
+        return 0  # not made yet, or just being written
 
 
 class TwoProcesses(MachineTest):
