@@ -18,6 +18,7 @@
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
 #include "os/testing/TemporaryDirectory.h"
+#include "platform/testing/Fakes.h"
 
 namespace tessel {
 namespace {
@@ -35,10 +36,10 @@ struct Reading {
   ErrorCode code = ErrorCode::failed;
 };
 
-Reading readStore(const std::string& path, TimeRange range = {}) {
+Reading readStore(const std::string& path, TimeRange range = {}, ServiceStatus* status = nullptr) {
   testing::RecordingTokenizer tokenizer;
   StopFlag stop{false};
-  auto opened = JournalStore::open(path, range, tokenizer, stop);
+  auto opened = JournalStore::open(path, range, tokenizer, stop, status);
   if (auto* error = std::get_if<PlatformError>(&opened)) return {{}, {}, error->words, error->code};
   JournalStore& store = *std::get<0>(opened);
   Reading reading;
@@ -300,6 +301,24 @@ TEST(JournalStoreTest, DecompressesARepeatedValueOnce) {
   auto opened = JournalStore::open(path, {}, tokenizer, stop);
   ASSERT_EQ(testing::readAll(std::get<0>(opened)->entries(), tokenizer).at(0).fields.size(), 1000u);
   EXPECT_EQ(tokenizer.shown(), 1u);
+}
+
+// Otherwise the watchdog would end a run that opens thousands of files from a slow disk, or that
+// passes over days of entries to reach its own.
+TEST(JournalStoreTest, OpeningFilesAndPassingOverEntriesIsProgress) {
+  const TemporaryDirectory directory;
+  const TimeRange future{UINT64_MAX - 1, UINT64_MAX};
+  for (int i = 0; i < 5; ++i) directory.write(std::to_string(i) + ".journal", someJournal(1));
+  testing::FakeServiceStatus status;
+  EXPECT_TRUE(readStore(directory.path(), future, &status).entries.empty());
+  EXPECT_GE(status.steps, 5u + 5u) << "found, opened";
+  std::string text;
+  for (int i = 1; i <= 640; ++i)
+    text += "__REALTIME_TIMESTAMP=" + std::to_string(i) +
+            "\n__MONOTONIC_TIMESTAMP=1\n_BOOT_ID=" + std::string(32, 'a') + "\nMESSAGE=old\n\n";
+  status.steps = 0;
+  EXPECT_TRUE(readStore(directory.write("old.export", text), future, &status).entries.empty());
+  EXPECT_GE(status.steps, 1u + 1u + 640u / 64);
 }
 
 TEST(JournalStoreTest, ReadsOnlySomeUnknownFiles) {

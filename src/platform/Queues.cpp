@@ -44,7 +44,8 @@ namespace tessel {
 
 namespace {
 
-// The unit allows the process 32 tasks. Half a dozen are the threads that always exist.
+// The unit allows the process 32 tasks. Sixteen may be children that read journal files of an
+// unknown layout, and eight are threads that always exist or watch the configuration.
 constexpr size_t kMostPoolThreads = 8;
 // An idle thread waits this long for work. A run submits its closures within microseconds of each
 // other, so one thread serves them all. An idle process has given its threads back after 20 ms.

@@ -147,8 +147,8 @@ class ServiceStatus {
   // What the process is doing now, in a few words for a human: "reading the trace store".
   virtual void say(std::string_view words) = 0;
   // Says that work moved on by a step. Cheap enough for every trace object: most calls only read a
-  // clock. If a working process does not call it within the watchdog period, the manager takes the
-  // process for hung and kills it.
+  // clock. A process that works and does not call it for a minute and a watchdog period is taken
+  // for hung, and the manager kills it.
   virtual void progress() = 0;
 };
 
