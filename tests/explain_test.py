@@ -363,7 +363,7 @@ class Reading(ExplainTest):
         self.assertEqual(store["dropped"], [{"unit": "vantor.service", "count": 7}])
         self.assertEqual(self.summary()["without_exe"], 1)
         text = self.machine.ctl("explain", "--summary").out
-        for words in ("reaches back to", "7 entries_missing: 1 gap in", "(vantor.service)", "process gone before _EXE was read"):
+        for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed or lost", "(vantor.service)", "process gone before _EXE was read"):
             self.assertIn(words, text)
 
     def test_the_page_shows_what_was_lost(self):

@@ -29,9 +29,9 @@ namespace {
 constexpr std::string_view kEntryStart = "\n\n__CURSOR=";
 constexpr std::string_view kEntryEnd = "\n\n";
 // Bytes. We look for the last entry at the end of the file. kFirstLook holds a usual entry; each
-// further look takes four times as much. After a look of more than kLastLook, four times what a
-// reader keeps of an entry, we give up. The new entry then begins a sequence of its own, and
-// readers cannot tell whether entries before it are missing.
+// further look takes four times as much. kLastLook is four times what a reader keeps of an entry.
+// If that holds no beginning of an entry, the new one begins a sequence of its own, and readers
+// cannot tell whether entries before it are missing.
 constexpr off_t kFirstLook = off_t{64} * 1024;
 constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
 constexpr const char* kSocket = "/run/systemd/journal/socket";
@@ -118,7 +118,7 @@ std::optional<EntryHeader> lastEntry(int fd, off_t size) {
     std::string tail = readAt(fd, from, static_cast<size_t>(size - from));
     if (from == 0) tail.insert(0, kEntryEnd);  // the first entry has no empty line before it
     if (const auto header = lastEntryIn(tail)) return header;
-    if (from == 0 || look > kLastLook) return std::nullopt;
+    if (from == 0 || look >= kLastLook) return std::nullopt;
   }
 }
 

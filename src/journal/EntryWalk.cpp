@@ -90,6 +90,15 @@ uint64_t EntryChain::last() {
   return 0;
 }
 
+bool headerTellsTimes(JournalFile& file, const StopFlag& stop) {
+  EntryHeader entry;
+  const uint64_t first = EntryChain(file, stop).next();
+  if (file.readEntry(first, first, entry) == 0 || entry.realtime != file.header().headRealtime)
+    return false;
+  const uint64_t last = EntryChain(file, stop).last();
+  return file.readEntry(last, last, entry) != 0 && entry.realtime == file.header().tailRealtime;
+}
+
 EntryWalk::EntryWalk(JournalFile& file, FileReport& report, const StopFlag& stop)
     : file_(file),
       report_(report),

@@ -79,6 +79,9 @@ class EntryChain {
   bool endedEarly_ = false;
 };
 
+// Whether the first and the last entry that `file` lists have the times that its header gives them.
+bool headerTellsTimes(JournalFile& file, const StopFlag& stop);
+
 class EntryWalk {
  public:
   // Tells `report` of damage. All must outlive the walk.

@@ -292,10 +292,20 @@ bool endedWell(pid_t child) {
   return WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
 
+// journalctl takes a pattern for a path, so a file named "[a].journal" would be another one.
+std::string asPattern(std::string_view path) {
+  std::string pattern;
+  for (const char c : path) {
+    if (std::string_view("*?[\\").find(c) != std::string_view::npos) pattern += '\\';
+    pattern += c;
+  }
+  return pattern;
+}
+
 // Starts journalctl with `output` as its standard output; 0 if it cannot be started. A spawn
 // instead of a fork, because other threads may hold locks that a forked child would wait for.
 pid_t startJournalctl(const std::string& path, int output) {
-  std::string file = "--file=" + path;
+  std::string file = "--file=" + asPattern(path);
   std::array<std::string, 5> words = {"journalctl", "--output=export", "--all", "--quiet", file};
   std::array<char*, 6> arguments{};
   for (size_t i = 0; i < words.size(); ++i) arguments[i] = words[i].data();

@@ -70,6 +70,7 @@ class WindowedFile {
   bool removed() const;
   // Whether a read failed or found the file shorter than it was. Stays true.
   bool failed() const { return failed_; }
+  bool wasCut() const { return size_ < openedSize_; }
 
   // Returns the `size` bytes at `offset`, or null if the file does not hold them. If they are not
   // in the window, the window moves. A caller that will also look at bytes before them passes the
@@ -103,6 +104,7 @@ class WindowedFile {
 
   UniqueFd fd_;
   uint64_t size_;
+  const uint64_t openedSize_ = size_;
   WindowBudget& budget_;
   bool failed_ = false;
   std::unique_ptr<uint8_t[]> window_;

@@ -35,9 +35,10 @@ std::string_view textOf(std::span<const uint8_t> bytes) {
 
 }  // namespace
 
-JournalEntryStream::JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header,
-                                       uint32_t number, const Context& context)
-    : file_(std::move(fd), size, header, context.resources.windows),
+JournalEntryStream::JournalEntryStream(std::unique_ptr<JournalFile> file, uint32_t number,
+                                       const Context& context)
+    : owned_(std::move(file)),
+      file_(*owned_),
       number_(number),
       context_(context),
       walk_(file_, context.report, context.stop),
@@ -93,7 +94,9 @@ void JournalEntryStream::finish() {
   // When the daemon closes a file it cuts off the end that it has not used. Nothing is lost then,
   // so a failed read alone is no problem.
   if (file_.file().failed() && (missing != 0 || !problems.empty()))
-    context_.report.addProblem("cut short or not readable", file_.file().size());
+    context_.report.addProblem(
+        file_.file().wasCut() ? "cut short while it was read" : "not readable",
+        file_.file().size());
   context_.report.addProblem("entries missing", file_.objectsEnd(), missing);
   // The last entry has no later neighbour. The header of a closed file has its times instead.
   if (!file_.header().beingWritten() && walk_.entriesFound() != 0 &&

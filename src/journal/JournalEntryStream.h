@@ -21,6 +21,7 @@
 #pragma once
 
 #include <array>
+#include <memory>
 #include <optional>
 #include <string_view>
 #include <vector>
@@ -61,10 +62,8 @@ class JournalEntryStream final : public EntryStream {
     FileReport& report;
   };
 
-  // Reads the file of `fd`, which has `size` bytes and the header `header`. `number` is different
-  // for each file of a store and below JournalStore::kMaxFiles.
-  JournalEntryStream(UniqueFd fd, uint64_t size, const JournalHeader& header, uint32_t number,
-                     const Context& context);
+  // `number` is different for each file of a store and below JournalStore::kMaxFiles.
+  JournalEntryStream(std::unique_ptr<JournalFile> file, uint32_t number, const Context& context);
 
   bool next() override;
   const EntryHeader& header() const override { return walk_.header(); }
@@ -96,7 +95,8 @@ class JournalEntryStream final : public EntryStream {
   FieldToken tokenOf(const Text& text);
   std::optional<Decompressor::Result> decompress(const DataObject& data, std::span<uint8_t> target);
 
-  JournalFile file_;
+  const std::unique_ptr<JournalFile> owned_;
+  JournalFile& file_;
   const uint32_t number_;
   Context context_;
   EntryWalk walk_;

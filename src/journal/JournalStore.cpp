@@ -3,6 +3,8 @@
 #include "journal/JournalStore.h"
 
 #include <algorithm>
+#include <filesystem>
+#include <map>
 #include <utility>
 #include <vector>
 
@@ -10,71 +12,13 @@
 #include "journal/ExportEntryStream.h"
 #include "journal/JournalEntryStream.h"
 #include "journal/LossTokenizer.h"
+#include "journal/NumberWatch.h"
 #include "journal/StoreFiles.h"
 #include "platform/Invariant.h"
 
 namespace tessel {
 
 namespace {
-
-// Counts the sequence numbers that do not appear. The daemon numbers entries without gaps, so a gap
-// means that a file was removed or damaged.
-class SequenceWatch {
- public:
-  void see(const EntryHeader& entry) {
-    // Entries of one sequence come in long rows, so we try the last sequence before we search all.
-    if (last_ < seen_.size() && sameId(seen_[last_].id, entry.sequenceId)) {
-      advance(seen_[last_], entry.sequenceNumber);
-    } else {
-      change(entry);
-    }
-  }
-  uint64_t gaps() const { return gaps_; }
-  uint64_t missing() const { return missing_; }
-
- private:
-  // A machine has few sequences: a daemon begins one only if it finds no earlier file to continue.
-  // We look through them one by one, so a store that was made to have thousands would cost time.
-  // Sequences beyond this bound are not watched.
-  static constexpr size_t kMaxSequences = 1024;
-
-  struct Sequence {
-    Id128 id;
-    uint64_t number;
-  };
-
-  void advance(Sequence& sequence, uint64_t number) {
-    // A lower number comes only from damage or copies. If we went back to it, we would count the
-    // same gap again.
-    if (number <= sequence.number) return;
-    const uint64_t leftOut = number - sequence.number - 1;
-    gaps_ += leftOut != 0;
-    missing_ += leftOut;
-    sequence.number = number;
-  }
-  void change(const EntryHeader& entry);
-
-  std::vector<Sequence> seen_;
-  size_t last_ = 0;
-  uint64_t gaps_ = 0;
-  uint64_t missing_ = 0;
-};
-
-void SequenceWatch::change(const EntryHeader& entry) {
-  // Entries without a sequence id may come from many sequences, so a gap between their numbers
-  // means nothing.
-  if (entry.sequenceId == Id128{}) return;
-  const auto known = std::find_if(seen_.begin(), seen_.end(), [&](const Sequence& sequence) {
-    return sequence.id == entry.sequenceId;
-  });
-  if (known == seen_.end() && seen_.size() >= kMaxSequences) return;
-  last_ = static_cast<size_t>(known - seen_.begin());
-  if (known == seen_.end()) {
-    seen_.push_back({entry.sequenceId, entry.sequenceNumber});
-  } else {
-    advance(*known, entry.sequenceNumber);
-  }
-}
 
 // Two files with equal keys would return each other's tokens.
 static_assert(JournalStore::kMaxFiles <= TokenCache::kMaxFiles);
@@ -92,6 +36,8 @@ void addFile(const FileReport& file, StoreReading& reading) {
     ++reading.filesRead;
   } else if (file.outsideRange) {
     ++reading.filesOutsideRange;
+    if (reading.outsideRange.size() < StoreReading::kMaxNamed)
+      reading.outsideRange.push_back(file.path);
   } else {
     reading.losses.add(LossCode::fileSkipped, *file.skipped, {file.path, {}});
   }
@@ -113,7 +59,7 @@ struct JournalStore::State final : EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return merger.header(); }
-  Entry entry() override;
+  Entry entry() override { return {merger.header(), tokens}; }
 
   void openFiles(StoreFiles found);
   void openFile(StoreFile& file, uint32_t number);
@@ -141,31 +87,30 @@ struct JournalStore::State final : EntryStream {
   size_t usableFiles = 0;
   ErrorCode firstFailure = ErrorCode::notAStore;  // why the first file is not usable
   size_t foreignFiles = 0;                        // that journalctl reads for us
-  SequenceWatch sequences;
+  std::vector<uint32_t> counters;                 // by file: the same for files of one daemon
+  NumberWatch numbers;
   StoreMerger merger;
+  std::span<const FieldToken> tokens;  // of the current entry
 };
 
 bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
     if (++entriesMerged % kEntriesPerStep == 0) makeProgress();
-    // Entries outside the range count too: they show how far back the store reaches, and without
-    // them their numbers would look like gaps.
-    sequences.see(entry);
+    // Entries outside the range show how far back the store reaches. Their numbers do not matter:
+    // further ones of them may stand in files that are not read.
     seeTime(entry.realtime);
     if (entry.realtime < range.start || entry.realtime >= range.end) continue;
+    const uint32_t file = merger.streamNumber();
+    numbers.see(counters[file], entry);
     ++facts.reading.entriesRead;
-    ++facts.files[merger.streamNumber()].entriesRead;
+    ++facts.files[file].entriesRead;
+    // The daemon's loss messages end here, so that the user sees only tokens of its own, and so
+    // that they are counted even if the user does not look at the entry.
+    tokens = tokenizer.takeOwn(merger.entry().tokens);
     return true;
   }
   return false;
-}
-
-Entry JournalStore::State::entry() {
-  // The fields of the daemon's loss messages end here, so that the user sees only tokens of its
-  // own.
-  const Entry whole = merger.entry();
-  return {whole.header, tokenizer.takeOwn(whole.tokens)};
 }
 
 // Streams keep references to elements of facts.files, so it gets its final length before the first
@@ -174,11 +119,20 @@ void JournalStore::State::openFiles(StoreFiles found) {
   facts.reading.losses.add(LossCode::filesNotLookedAt, "too many files to look at", {},
                            found.leftOut);
   facts.files.resize(found.files.size());
-  for (uint32_t i = 0; i < found.files.size() && !stop.load(std::memory_order_relaxed); ++i) {
+  // A daemon keeps its files in one directory, or in two of the same name: see StoreFiles.
+  std::map<std::string, uint32_t> directories;
+  uint32_t opened = 0;
+  while (opened < found.files.size() && !stop.load(std::memory_order_relaxed)) {
     makeProgress();
-    facts.files[i].path = found.files[i].path;
-    openFile(found.files[i], i);
+    facts.files[opened].path = found.files[opened].path;
+    const auto directory =
+        std::filesystem::path(found.files[opened].path).parent_path().filename().string();
+    counters.push_back(directories.try_emplace(directory, static_cast<uint32_t>(directories.size()))
+                           .first->second);
+    openFile(found.files[opened], opened);
+    ++opened;
   }
+  facts.files.resize(opened);  // after a stop: the others are neither read nor skipped
 }
 
 void JournalStore::State::openFile(StoreFile& file, uint32_t number) {
@@ -216,7 +170,8 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
   ++usableFiles;
   // The header tells the age of a file even if we need not read the file.
   if (header.headRealtime != 0) seeTime(header.headRealtime);
-  if (outsideRange(header)) {
+  auto journal = std::make_unique<JournalFile>(std::move(file.fd), size, header, resources.windows);
+  if (outsideRange(header) && headerTellsTimes(*journal, stop)) {
     report.skipped = "outside the range";
     report.outsideRange = true;
     return;
@@ -225,7 +180,7 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
   // larger, because files that could not be opened stand there as well.
   TESSEL_INVARIANT(usableFiles <= kMaxFiles);
   merger.add(std::make_unique<JournalEntryStream>(
-                 std::move(file.fd), size, header, usableFiles - 1,
+                 std::move(journal), usableFiles - 1,
                  JournalEntryStream::Context{resources, tokenizer, marks, stop, report}),
              number, header.sequenceId);
 }
@@ -251,10 +206,11 @@ void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint
 }
 
 // The header has the times of the first and last entry written. To skip a file by these two spares
-// most of the work of a run over a long journal. The price: if the clock was set while the file was
-// written, entries between may be earlier or later than both. If the last entry is earlier than the
-// first, we see that the clock was set, and read the file. Otherwise such entries are lost; to find
-// them we would have to look at every entry.
+// most of the work of a run over a long journal. A wrong word in the header must not hide a file,
+// so the caller compares both with the entries themselves. The price: if the clock was set while
+// the file was written, entries between may be earlier or later than both. If the last entry is
+// earlier than the first, we see that the clock was set, and read the file. Otherwise such entries
+// are lost; to find them we would have to look at every entry.
 bool JournalStore::State::outsideRange(const JournalHeader& header) const {
   if (header.beingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
@@ -302,12 +258,16 @@ StoreReport JournalStore::report() const {
   }
   TESSEL_INVARIANT(inFiles == reading.entriesRead);  // each delivered entry counts for one file
   reading.duplicateEntries = state_->merger.duplicates();
-  reading.sequenceGaps = state_->sequences.gaps();
-  reading.losses.add(LossCode::entriesMissing,
-                     std::to_string(reading.sequenceGaps) +
-                         (reading.sequenceGaps == 1 ? " gap" : " gaps") +
-                         " in the sequence numbers",
-                     {}, state_->sequences.missing());
+  reading.sequenceGaps = state_->numbers.gaps();
+  reading.missingNumbers = state_->numbers.missing();
+  // The daemon removes old files, so missing numbers alone are no loss. Beside one they tell its
+  // size.
+  if (!reading.losses.empty())
+    reading.losses.add(LossCode::entriesMissing,
+                       "numbers that no file holds: vacuumed or lost, in " +
+                           std::to_string(reading.sequenceGaps) +
+                           (reading.sequenceGaps == 1 ? " gap" : " gaps"),
+                       {}, reading.missingNumbers);
   state_->tokenizer.addDropped(reading.losses);
   return report;
 }

@@ -39,6 +39,8 @@ class Finder {
 
   // Lists `directory` until a listing shows nothing new. Returns 0, or errno if it cannot be read.
   int addDirectory(const std::string& directory);
+  // Adds the journals of `machine` under `place`, those of its namespaces included.
+  int addMachine(const std::string& place, const std::string& machine);
   void addFile(const std::string& path, StoreFileKind kind);
   StoreFiles take();
 
@@ -70,6 +72,20 @@ int Finder::addDirectory(const std::string& directory) {
     if (error != 0) break;
   }
   return error;
+}
+
+// A service with LogNamespace= writes to a daemon of its own, which keeps its files beside those of
+// the main one, in a directory named after the machine and the namespace.
+int Finder::addMachine(const std::string& place, const std::string& machine) {
+  const std::unique_ptr<DIR, int (*)(DIR*)> listing(::opendir(place.c_str()), ::closedir);
+  while (const dirent* entry = listing ? ::readdir(listing.get()) : nullptr) {
+    const std::string name = entry->d_name;
+    if (!name.starts_with(machine + ".") || stop_.load(std::memory_order_relaxed)) continue;
+    const int error = addDirectory(place + "/" + name);
+    if (error != 0 && error != ENOENT && error != ENOTDIR)
+      fail(place + "/" + name, StoreFileKind::journal, error);
+  }
+  return addDirectory(place + "/" + machine);
 }
 
 int Finder::list(const std::string& directory, int depth) {
@@ -153,14 +169,16 @@ std::variant<StoreFiles, PlatformError> machineJournal(Finder& finder) {
   if (machine.empty())
     return PlatformError{ErrorCode::notFound,
                          "/etc/machine-id: the machine has no identity, so no journal"};
-  const std::string stored = "/var/log/journal/" + machine;
-  const int errors[] = {finder.addDirectory(stored),
-                        finder.addDirectory("/run/log/journal/" + machine)};
-  for (const int error : errors)
-    if (error != 0 && error != ENOENT) return storeError(stored, error);
-  if (errors[0] != 0 && errors[1] != 0)
-    return PlatformError{ErrorCode::notFound,
-                         stored + ": the machine keeps no journal, here or under /run/log/journal"};
+  bool found = false;
+  for (const std::string place : {"/var/log/journal", "/run/log/journal"}) {
+    const int error = finder.addMachine(place, machine);
+    if (error != 0 && error != ENOENT) return storeError(place + "/" + machine, error);
+    found = found || error == 0;
+  }
+  if (!found)
+    return PlatformError{ErrorCode::notFound, "/var/log/journal/" + machine +
+                                                  ": the machine keeps no journal, here or under "
+                                                  "/run/log/journal"};
   return finder.take();
 }
 

@@ -15,6 +15,7 @@
 #include "journal/ExportEntryStream.h"
 #include "journal/JournalFormat.h"
 #include "journal/LossTokenizer.h"
+#include "journal/testing/JournalDamage.h"
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
 #include "os/testing/TemporaryDirectory.h"
@@ -149,6 +150,13 @@ TEST(JournalStoreTest, SkipsClosedFilesOutsideTheRange) {
   EXPECT_FALSE(reading.report.files.at(2).skipped);
   EXPECT_EQ(reading.report.reading.oldestEntry, kBase + 1'000'000);
   EXPECT_TRUE(reading.report.reading.reachesRangeStart());
+  EXPECT_EQ(reading.report.reading.outsideRange, std::vector{directory.path("a.journal")});
+  // A wrong word in the header does not hide the file.
+  std::string file = someJournal(10, 11);
+  testing::put(file, journal_format::kTailRealtimeAt, kBase + 12'000'000);
+  directory.write("b.journal", file);
+  EXPECT_EQ(readStore(directory.path(), {kBase + 13'000'000, kBase + 16'000'000}).entries.size(),
+            3u);
 }
 
 TEST(JournalStoreTest, FiltersEachEntryByASetBackClock) {
@@ -173,13 +181,29 @@ TEST(JournalStoreTest, FiltersEachEntryByASetBackClock) {
   EXPECT_EQ(numbers(readStore(a, {999, 1002})), (std::vector<uint64_t>{1, 29, 30, 31}));
 }
 
-TEST(JournalStoreTest, TellsGapsInTheSequence) {
+// One daemon numbers the entries of all its files, though a user's file has a sequence of its own.
+TEST(JournalStoreTest, MissesOnlyNumbersThatNoFileHolds) {
   const TemporaryDirectory directory;
-  directory.write("a.journal", someJournal(10, 1));
-  directory.write("b.journal", someJournal(10, 14));
-  const Reading reading = readStore(directory.path());
-  EXPECT_EQ(reading.report.reading.sequenceGaps, 1u);
-  EXPECT_EQ(reading.report.reading.losses.sum(LossCode::entriesMissing), 3u);
+  JournalWriter system, user({.sequenceId = {9}});
+  for (uint64_t i = 1; i <= 300; ++i) {
+    EntryHeader header{{}, i, {1}, i * 10, 1000 + i * 10, 0};
+    if (i == 20) header.sequenceNumber += uint64_t{1} << 30;  // a flipped bit
+    (i % 3 == 0 ? user : system).add(header, {"PRIORITY=6"});
+  }
+  const Reading whole = [&] {
+    directory.write("system.journal", system.bytes());
+    directory.write("user-1000.journal", user.bytes());
+    return readStore(directory.path());
+  }();
+  EXPECT_EQ(whole.report.reading.missingNumbers, 1u) << "that of the entry with the wrong one";
+  directory.write("system.journal", someJournal(10, 1));
+  directory.write("user-1000.journal", someJournal(10, 14));
+  const Reading gap = readStore(directory.path());
+  EXPECT_EQ(gap.report.reading.sequenceGaps, 1u);
+  EXPECT_EQ(gap.report.reading.missingNumbers, 3u);
+  EXPECT_TRUE(gap.report.reading.losses.empty()) << "the daemon may have removed them";
+  directory.write("noise.journal", "noise");
+  EXPECT_EQ(readStore(directory.path()).report.reading.losses.sum(LossCode::entriesMissing), 3u);
   const std::string last = "__REALTIME_TIMESTAMP=1\n__SEQNUM_ID=" + std::string(32, 'a') +
                            "\n__SEQNUM=18446744073709551615\n\n";
   EXPECT_EQ(readStore(directory.write("a.export", last + last)).report.reading.sequenceGaps, 0u);

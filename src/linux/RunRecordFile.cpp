@@ -74,6 +74,7 @@ void addReading(JsonWriter& json, const StoreReading& reading) {
   json.member("last_entry", reading.lastEntry).member("range_end", reading.rangeEnd);
   json.member("stopped", reading.stopped);
   json.member("sequence_gaps", reading.sequenceGaps);
+  json.member("missing_numbers", reading.missingNumbers);
   json.member("files_read", reading.filesRead);
   json.member("files_outside_range", reading.filesOutsideRange);
   json.array("losses", reading.losses.all(),
@@ -86,6 +87,7 @@ StoreReading readingFrom(const Json& json) {
   reading.duplicateEntries = countAt(json, "duplicates");
   reading.rangeStart = countAt(json, "range_start");
   reading.sequenceGaps = countAt(json, "sequence_gaps");
+  if (json.contains("missing_numbers")) reading.missingNumbers = countAt(json, "missing_numbers");
   reading.filesRead = countAt(json, "files_read");
   reading.filesOutsideRange = countAt(json, "files_outside_range");
   if (json.contains("oldest")) reading.oldestEntry = countAt(json, "oldest");

@@ -17,7 +17,7 @@ using testing::TemporaryDirectory;
 
 // Each kind of loss.
 StoreReading lossyDay() {
-  StoreReading reading{1000, 11, 1'795'000'000'000'000, 1'794'000'000'000'000, 1, 3, 1, {}};
+  StoreReading reading{1000, 11, 1'795'000'000'000'000, 1'794'000'000'000'000, 1, 4, 3, 1, {}, {}};
   for (size_t code = 0; code < kLossCodes; ++code)
     reading.losses.add(static_cast<LossCode>(code), "words", {}, code + 1);
   reading.losses.add(LossCode::fileDamaged, "entry damaged", {"/j/a.journal", 123}, 7);
@@ -94,7 +94,8 @@ TEST(RunRecordTest, OneWithADamagedReadingIsNone) {
   const TemporaryDirectory directory;
   ASSERT_FALSE(writeRunRecord(mixedDay(), directory.path()));
   const auto whole = nlohmann::json::parse(directory.read("last_run.json"));
-  const std::set<std::string> optional{"oldest", "last_entry", "range_end", "stopped"};
+  const std::set<std::string> optional{"oldest", "last_entry", "range_end", "stopped",
+                                       "missing_numbers"};
   for (const auto& [member, value] : whole.at("reading").items()) {
     auto damaged = whole;
     damaged["reading"][member] = "text";

@@ -26,7 +26,7 @@ enum class LossCode : uint8_t {
   fileSkipped,       // files that were not read; the place is the path
   filesNotLookedAt,  // files beyond the limit on their number
   fileDamaged,       // damaged spots in files; the place is the first file and its byte
-  entriesMissing,    // sequence numbers that no entry has
+  entriesMissing,    // numbers that no file holds, or entries of a removed file
   droppedByDaemon,   // entries that the journal daemon dropped; the place is the unit
   noImagePath,       // trace points whose executable is not known
   malformed,         // entries with the mark of a trace point but bad fields
@@ -111,10 +111,13 @@ struct StoreReading {
   // The oldest entry that the store still holds, in microseconds since 1970. For a file that was
   // not read, its header tells. Absent if there is no entry.
   std::optional<uint64_t> oldestEntry;
-  uint64_t rangeStart = 0;    // microseconds since 1970
-  uint64_t sequenceGaps = 0;  // jumps of the sequence number by more than one
+  uint64_t rangeStart = 0;      // microseconds since 1970
+  uint64_t sequenceGaps = 0;    // rows of numbers between others that no file holds
+  uint64_t missingNumbers = 0;  // in all gaps; a loss only if `losses` tells of one
   uint64_t filesRead = 0;
   uint64_t filesOutsideRange = 0;  // not read, because all their entries are of another period
+  static constexpr size_t kMaxNamed = 16;  // fit on a screen
+  std::vector<std::string> outsideRange;   // the paths of the first kMaxNamed of these
   Losses losses;
   bool stopped = false;                    // before the end of the period was reached
   uint64_t rangeEnd = 0;                   // microseconds since 1970

@@ -34,9 +34,11 @@ void checkBooks(const ExtractionReport& report) {
 
 // We log at the end of the reading, one line for each loss of the list. A line for each damaged
 // entry would fill the very journal that we read.
-void logLosses(const Losses& losses) {
+void logLosses(const StoreReading& reading) {
   if (!tesselReporterLog().isEnabled(LogLevel::debug)) return;
-  for (const Loss& loss : losses.all()) {
+  for (const std::string& path : reading.outsideRange)
+    tesselReporterLog().debug("Trace store: of another period: %@", path);
+  for (const Loss& loss : reading.losses.all()) {
     tesselReporterLog().debug("Trace store: lost %llu %@", loss.count, loss);
   }
 }
@@ -93,7 +95,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
   JournalStore& store = *std::get<std::unique_ptr<JournalStore>>(opened);
   processEntries(store.entries());
   report_.store = store.report();
-  logLosses(report().store.reading.losses);
+  logLosses(report().store.reading);
   return true;
 }
 

@@ -31,6 +31,22 @@ std::string partOfPeriod(const StoreReading& reading) {
   return "The store reaches back to " + dateText(oldest) + " only";
 }
 
+// Each line tells what is not there without being a loss.
+std::vector<std::string> notesOn(const StoreReading& reading) {
+  std::vector<std::string> notes;
+  if (std::string part = partOfPeriod(reading); !part.empty()) notes.push_back(std::move(part));
+  if (reading.missingNumbers != 0 && reading.losses.sum(LossCode::entriesMissing) == 0)
+    notes.push_back(grouped(reading.missingNumbers) +
+                    " numbers of entries that no file holds: vacuumed or lost");
+  if (reading.filesOutsideRange != 0) {
+    std::string note = grouped(reading.filesOutsideRange) + " not read, of another period:";
+    for (const std::string& path : reading.outsideRange) note += " " + path;
+    if (reading.outsideRange.size() < reading.filesOutsideRange) note += " ...";
+    notes.push_back(std::move(note));
+  }
+  return notes;
+}
+
 void addLosses(JsonWriter& json, const Losses& losses) {
   json.array("losses", losses.all(), [&](const Loss& loss) {
     json.object([&] {
@@ -77,7 +93,7 @@ void addStore(JsonWriter& json, const StoreReading& reading) {
     json.member("range_start", reading.rangeStart).member("entries_read", reading.entriesRead);
     json.member("duplicates", reading.duplicateEntries);
     json.member("sequence_gaps", reading.sequenceGaps);
-    json.member("missing", losses.sum(LossCode::entriesMissing));
+    json.member("missing", reading.missingNumbers);
     json.member("files_not_looked_at", losses.sum(LossCode::filesNotLookedAt));
     json.array("dropped", toldApart(losses, LossCode::droppedByDaemon), [&](const Loss& loss) {
       json.object([&] { json.member("unit", loss.place.name).member("count", loss.count); });

@@ -19,6 +19,10 @@ std::string partOfPeriod(const StoreReading& reading);
 // A sentence if a stop left a part of the period unread, without its full stop; else empty.
 std::string unreadPart(const StoreReading& reading);
 
+// What is not there without being a loss: the start of the period, numbers, files of other periods.
+// Sentences without their full stops, not yet fit for a terminal.
+std::vector<std::string> notesOn(const StoreReading& reading);
+
 // Writes the member `losses`. All commands write it alike.
 void addLosses(JsonWriter& json, const Losses& losses);
 // Writes the member `malformed`: a count for each reason.

@@ -308,7 +308,8 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
   }
   out += unpairedTable(report.assembly, terminal);
   const StoreReading& reading = report.store.reading;
-  if (const std::string part = partOfPeriod(reading); !part.empty()) out += "\n" + part + ".\n";
+  for (const std::string& note : notesOn(reading))
+    out += "\n" + wrapped(terminalText(note), terminal.width, 2) + ".\n";
   if (!reading.losses.empty()) out += "\n" + lossText(reading.losses, terminal);
   return out;
 }
