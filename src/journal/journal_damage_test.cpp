@@ -10,7 +10,9 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <functional>
 #include <random>
@@ -36,6 +38,7 @@ constexpr size_t kArenaSizeAt = 96;  // we do not believe it
 struct Outcome {
   std::vector<uint64_t> numbers;
   bool problemTold = false;
+  std::string problem = {};  // the first one's words
   bool refused = false;
 };
 
@@ -45,7 +48,7 @@ Outcome read(const std::string& path, size_t pause = SIZE_MAX,
   testing::RecordingTokenizer tokenizer;
   StopFlag stop{false};
   auto opened = JournalStore::open(path, {}, tokenizer, stop);
-  if (opened.index() == 1) return {{}, true, true};
+  if (opened.index() == 1) return {{}, true, {}, true};
   JournalStore& store = *std::get<0>(opened);
   Outcome outcome;
   while (store.entries().next()) {
@@ -54,6 +57,8 @@ Outcome read(const std::string& path, size_t pause = SIZE_MAX,
   }
   const StoreReport report = store.report();
   outcome.problemTold = !report.files.at(0).problems.empty() || report.files.at(0).skipped;
+  const Losses& problems = report.files.at(0).problems;
+  if (!problems.empty()) outcome.problem = problems.all()[0].words;
   return outcome;
 }
 
@@ -92,11 +97,23 @@ TEST_P(JournalDamageTest, FindsAllBehindADamagedChain) {
        [](auto& file, auto array) { file.replace(array + kArrayItemsAt, 16, 16, '\x18'); }},
       {"size too large",
        [](auto& file, auto array) { put(file, array + kObjectSizeAt, file.size()); }},
+      {"linked to a later one",
+       [&](auto& file, auto array) {
+         put(file, array + kArrayNextAt, writer.arrays()[writer.arrays().size() - 1]);
+       }},
+      {"first offset is that of the last entry",
+       [&](auto& file, auto array) {
+         const uint64_t last = writer.entries().back();
+         std::memcpy(file.data() + array + kArrayItemsAt, &last, layout().compact ? 4 : 8);
+       }},
   };
   for (const auto& [name, fault] : faults) {
     for (const uint64_t array : writer.arrays()) {
       // Nobody follows the link of the last array.
-      if (array == writer.arrays().back() && std::string(name).starts_with("linked")) continue;
+      const size_t behind = std::string(name).ends_with("later one") ? 2 : 1;
+      if (array >= writer.arrays()[writer.arrays().size() - behind] &&
+          std::string(name).starts_with("linked"))
+        continue;
       std::string file = writer.bytes();
       fault(file, array);
       const Outcome outcome = read(directory_.write("a.journal", file));
@@ -149,6 +166,52 @@ TEST_P(JournalDamageTest, SearchTakesTimeOfTheFilesSize) {
   }
   file.back() = 1;
   EXPECT_TRUE(read(directory_.write("a.journal", file)).problemTold);
+}
+
+// Each of these files let the reader read the same bytes again and again.
+TEST_P(JournalDamageTest, ReadsFilesMadeToTakeLongInTime) {
+  constexpr size_t kSize = size_t{4} << 20;
+  const auto begin = std::chrono::steady_clock::now();
+  // Entries that overlap, each with 2,000 fields.
+  std::string file = journalOf(1, layout()).bytes();
+  const size_t item = layout().compact ? kCompactEntryItemSize : kEntryItemSize;
+  const std::string entry = file.substr(journalOf(1, layout()).entries()[0], kEntryItemsAt);
+  const uint64_t first = file.size();
+  std::string list(kArrayItemsAt, '\0');
+  for (size_t i = 0; i < kSize / kEntryItemsAt; ++i) {
+    file += entry;
+    put(file, file.size() - kEntryItemsAt + kObjectSizeAt, kEntryItemsAt + 2000 * item);
+    put(file, file.size() - kEntryItemsAt + kEntrySequenceAt, i + 2);
+    const uint64_t offset = first + i * kEntryItemsAt;
+    list.append(reinterpret_cast<const char*>(&offset), layout().compact ? 4 : 8);
+  }
+  list[0] = kEntryArray;
+  put(list, kObjectSizeAt, list.size());
+  put(file, kEntryArrayAt, file.size());
+  put(file, kEntryCountAt, kSize / kEntryItemsAt);
+  EXPECT_TRUE(read(directory_.write("a.journal", file + list)).problemTold);
+  // Values that share one payload of frames which the decoder has to skip.
+  file = journalOf(0, layout()).bytes();
+  const uint64_t values = file.size();
+  std::string fields;
+  for (uint64_t i = 0; i < 2000; ++i) {
+    const uint64_t head[] = {kData | kZstd << 8, kSize - i * 72, 0, 0, 0, 0, 0, 1, 0};
+    file.append(reinterpret_cast<const char*>(head), sizeof head);
+    const uint64_t field[] = {values + i * 72, 0};
+    fields.append(reinterpret_cast<const char*>(field), layout().compact ? 4 : 16);
+  }
+  while (file.size() < values + kSize) file += std::string("\x50\x2a\x4d\x18\0\0\0\0", 8);
+  const uint64_t at = file.size();
+  file += entry + fields;
+  put(file, at + kObjectSizeAt, kEntryItemsAt + fields.size());
+  file.resize(alignUp(file.size()));
+  put(file, kEntryArrayAt, file.size());
+  const uint64_t array[] = {kEntryArray, kArrayItemsAt + sizeof at, 0, at};
+  file.append(reinterpret_cast<const char*>(array), sizeof array);
+  put(file, kEntryCountAt, 1);
+  EXPECT_TRUE(read(directory_.write("a.journal", file)).problemTold);
+  const std::chrono::duration<double> took = std::chrono::steady_clock::now() - begin;
+  EXPECT_LT(took.count(), 4.0) << "the reader used to take more than a minute";
 }
 
 TEST_P(JournalDamageTest, KeepsWhatLiesBeforeACut) {
@@ -210,6 +273,19 @@ TEST_F(JournalMeanwhileTest, RemovedOrRenamedIsReadWhole) {
   const auto remove = [&](size_t) { std::filesystem::remove(path_); };
   for (const Outcome& outcome : readWith(rename)) EXPECT_EQ(outcome.numbers.size(), kEntries);
   for (const Outcome& outcome : readWith(remove)) EXPECT_EQ(outcome.numbers.size(), kEntries);
+}
+
+// The daemon first removes a file and then frees its blocks.
+TEST_F(JournalMeanwhileTest, TellsRemovalFromDamage) {
+  for (const Outcome& outcome : readWith([&](size_t) {
+         const int fd = ::open(path_.c_str(), O_WRONLY | O_CLOEXEC);
+         std::filesystem::remove(path_);
+         ASSERT_EQ(::ftruncate(fd, 0), 0);
+         ::close(fd);
+       })) {
+    if (outcome.numbers.size() == kEntries) continue;
+    EXPECT_EQ(outcome.problem, "the file was removed while it was read");
+  }
 }
 
 TEST_F(JournalMeanwhileTest, ReportsWhatACutLoses) {

@@ -359,7 +359,7 @@ TEST(JournalStoreTest, ReadsOnlySomeUnknownFiles) {
 
 TEST(JournalStoreTest, JournalctlReadsForUsWhatItKnows) {
   const TemporaryDirectory directory;
-  const std::string path = directory.write("a.journal", someJournal(100));
+  const std::string path = directory.write("[a]*.journal", someJournal(100));
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
   FileReport report;
