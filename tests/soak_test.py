@@ -49,7 +49,7 @@ class Soak(MachineTest):
 
     def test_many_runs_leave_little_behind(self):
         self.machine.write_export([point("event", "com.vantor.Calendar", "View", f"Open{i}") for i in range(2)])
-        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="1", TESSEL_LOG_LEVEL="error", FAULT_HURRY="1",
+        process = self.machine.start(TESSEL_ACTIVITY_INTERVAL="2", TESSEL_LOG_LEVEL="error", FAULT_HURRY="1",
                                      LD_PRELOAD=os.path.join(BIN, "fault_shim.so"))
         self.addCleanup(process.kill)
         at = [RUNS // 10, RUNS // 4, RUNS // 2, RUNS]

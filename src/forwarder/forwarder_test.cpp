@@ -67,12 +67,14 @@ class ForwarderTest : public ::testing::Test {
 
   // Fills the spool the way the service does.
   void send(int64_t count) {
-    Spool spool(directory_.path(), clock_);
+    testing::ManualQueueFactory queues;
+    Spool spool(directory_.path(), {}, clock_, status_, queues.makeSerialQueue("writer"), queues);
     for (int64_t number = 1; number <= count; ++number) {
       Payload payload;
       payload.set("Number", Number{number});
-      ASSERT_TRUE(spool.sendEvent("a", payload));
+      ASSERT_TRUE(spool.sendEvent("a", payload, EventRank::object));
     }
+    ASSERT_EQ(spool.endRun().stored, static_cast<uint64_t>(count));
   }
   ForwarderOutcome deliver() {
     EXPECT_TRUE(state_.open().ok());

@@ -120,6 +120,8 @@ RunRecord recordFrom(const Json& json) {
   record.countEvents = countAt(json, "count_events");
   if (hasReading(json)) record.reading = readingFrom(json.at("reading"));
   record.rowsStored = countAt(json, "rows_stored");
+  // Records of an older service lack this.
+  record.rowsExpired = json.value("rows_expired", uint64_t{0});
   for (const auto& [reason, count] : json.at("rows_failed").items())
     record.rowsFailed.emplace_back(reason, count.get<uint64_t>());
   record.setAside = json.at("set_aside").get<std::vector<std::string>>();
@@ -148,7 +150,7 @@ std::optional<PlatformError> writeRunRecord(const RunRecord& record,
     json.member("unnamed", record.unnamed).member("unsendable", record.unsendable);
     json.member("count_events", record.countEvents);
     if (record.reading) json.object("reading", [&] { addReading(json, *record.reading); });
-    json.member("rows_stored", record.rowsStored);
+    json.member("rows_stored", record.rowsStored).member("rows_expired", record.rowsExpired);
     json.object("rows_failed", [&] {
       for (const auto& [reason, count] : record.rowsFailed) json.member(reason, count);
     });

@@ -64,6 +64,7 @@ RunRecord mixedDay() {
   record.unsendable = 1;
   record.countEvents = 7;
   record.rowsStored = 9;
+  record.rowsExpired = 12;
   record.rowsFailed = {{"locked", 1}, {"disk_full", 2}};
   record.setAside = {"statora.db.damaged-20261118T110640Z"};
   record.marker = "removed";

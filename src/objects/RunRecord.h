@@ -56,7 +56,8 @@ struct RunRecord {
   // Absent if nothing was read, or if the file has the reading in a form that we do not know.
   std::optional<StoreReading> reading;
 
-  uint64_t rowsStored = 0;                                   // in the spool
+  uint64_t rowsStored = 0;   // in the spool
+  uint64_t rowsExpired = 0;  // of earlier runs, removed because they had stood there too long
   std::vector<std::pair<std::string, uint64_t>> rowsFailed;  // every reason, also those with 0 rows
   std::vector<std::string> setAside;                         // file names of damaged spools
   std::string marker;                                        // "removed" or "still there"

@@ -18,11 +18,21 @@
 
 namespace tessel {
 
+// What an event tells of. Where room is short, events of a lower rank are refused first, so that
+// the sums of a run still get through when its objects do not.
+enum class EventRank : uint8_t {
+  object,      // an event of a trace object
+  count,       // a count of the summary
+  statistics,  // the totals of the run
+};
+
 class EventSender {
  public:
   virtual ~EventSender() = default;
-  // Sends one event. False if it was not taken. Called on the reporting queue only.
-  virtual bool sendEvent(std::string_view name, const Payload& payload) = 0;
+  // Sends one event. Never waits for a disk or a network. False if it was not taken. An event that
+  // was taken may still be lost later; the sender keeps account of that. Called on the reporting
+  // queue only.
+  virtual bool sendEvent(std::string_view name, const Payload& payload, EventRank rank) = 0;
 };
 
 // A value of a configuration: null, a number, a string, a list or a dictionary.

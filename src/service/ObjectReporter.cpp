@@ -69,12 +69,13 @@ void EventRoad::send(const std::shared_ptr<const TesselObject>& object,
   // The throttle sleeps on this thread, which is the one that delivers objects. The extractor
   // therefore slows down to the pace of the sends. If the queue slept instead, it would fill up.
   throttle_.throttleReportedEvent();
-  reportingQueue_.async([this, payload] { sender_.sendEvent(kFixedEventName, *payload); });
+  reportingQueue_.async(
+      [this, payload] { sender_.sendEvent(kFixedEventName, *payload, EventRank::object); });
   // An object without a second event takes this step, too. The pace of a run therefore only depends
   // on the number of reported objects.
   throttle_.throttleReportedEvent();
   reportingQueue_.async([this, object, payload] {
-    if (hasEventName(*object)) sender_.sendEvent(eventName(*object), *payload);
+    if (hasEventName(*object)) sender_.sendEvent(eventName(*object), *payload, EventRank::object);
   });
 }
 

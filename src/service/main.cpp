@@ -71,6 +71,7 @@ StateDirectory& stateDirectory(const std::string& path) {
 
 void addRows(RunRecord& record, const SpoolFigures& figures) {
   record.rowsStored = figures.stored;
+  record.rowsExpired = figures.expired;
   record.setAside = figures.setAside;
   for (size_t kind = 0; kind < kSpoolFailureKinds; ++kind) {
     record.rowsFailed.emplace_back(spoolFailureName(static_cast<SpoolFailure>(kind)),
@@ -78,19 +79,18 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
   }
 }
 
-// Writes the record of a run for `tesselctl status`, and prepares the spool for the next run. The
-// spool knows how many rows it stored only after endRun(), so endRun() comes first.
+// Writes the record of a run for `tesselctl status`. The spool knows how many rows it stored only
+// when the run has ended, which takes as long as the disk needs.
 void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirectory) {
-  spool.endRun();
+  const SpoolFigures figures = spool.endRun();
   if (record.outcome != RunOutcome::notTasked) {
-    addRows(record, spool.figures());
+    addRows(record, figures);
     record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
     if (const auto failure = writeRunRecord(record, stateDirectory)) {
       platformLog().warning("The record of the run is not written: %@", failure->words);
     }
     logRunWarnings(record);
   }
-  spool.beginRun();
 }
 
 // Makes the parts that take an object from the store to the spool.
@@ -132,7 +132,10 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& variant = keep<OsReleaseBuildVariant>(launch.osReleasePath);
   auto& configurations = keep<FileConfigurationService>(launch.configurationDirectory);
   auto& gate = keep<TaskingGate>(variant, configurations, queues, clock);
-  auto& spool = keep<Spool>(state.path(), clock);
+  const auto writerQueue =
+      std::make_shared<WorkerQueue>("tessel_reporter spool writer queue", QueueThread::own);
+  const SpoolLimits limits{launch.spoolLimitBytes, launch.spoolDays};
+  auto& spool = keep<Spool>(state.path(), limits, clock, status, writerQueue, queues);
   auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
                             [&spool, &state, &reportingQueue](const RunRecord& record) {

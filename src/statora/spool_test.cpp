@@ -56,12 +56,48 @@ class Reader {
   SqliteDatabase database_;
 };
 
-uint64_t failures(const Spool& spool, SpoolFailure kind) {
-  return spool.figures().failed[static_cast<size_t>(kind)];
+uint64_t failures(const SpoolFigures& figures, SpoolFailure kind) {
+  return figures.failed[static_cast<size_t>(kind)];
 }
+
+// The pages of 4 KiB that a limit of 8 MiB allows.
+constexpr SpoolLimits kSmall{.bytes = 8 << 20, .days = std::chrono::days{30}};
 
 class SpoolTest : public ::testing::Test {
  protected:
+  // A spool whose queue runs when told to.
+  class Bench {
+   public:
+    Bench(SpoolTest& test, const std::string& directory, SpoolLimits limits)
+        : queue_(std::make_shared<testing::ManualQueue>("writer")),
+          spool_(directory, limits, test.clock_, test.status_, queue_, timers_) {}
+
+    bool queue(const std::string& name, const Payload& payload,
+               EventRank rank = EventRank::object) {
+      return spool_.sendEvent(name, payload, rank);
+    }
+    bool send(const std::string& name, const Payload& payload, EventRank rank = EventRank::object) {
+      const bool taken = queue(name, payload, rank);
+      queue_->runAll();
+      return taken;
+    }
+    void tick() {
+      timers_.timers.front()->fire();
+      queue_->runAll();
+    }
+    SpoolFigures endRun() { return spool_.endRun(); }
+    size_t pending() const { return queue_->pending(); }
+
+   private:
+    std::shared_ptr<testing::ManualQueue> queue_;
+    testing::ManualQueueFactory timers_;
+    Spool spool_;
+  };
+
+  Bench bench(SpoolLimits limits = {}) { return Bench(*this, directory_.path(), limits); }
+  uint64_t sizeOf(const std::string& name) const {
+    return std::filesystem::file_size(directory_.path(name));
+  }
   std::vector<std::string> filesWith(const std::string& part) const {
     std::vector<std::string> names;
     for (const auto& entry : std::filesystem::directory_iterator(directory_.path())) {
@@ -73,20 +109,21 @@ class SpoolTest : public ::testing::Test {
 
   TemporaryDirectory directory_;
   FakeClock clock_;
+  testing::FakeServiceStatus status_;
   RecordingLog log_;
 };
 
 TEST_F(SpoolTest, RowsStandInSendOrder) {
-  Spool spool(directory_.path("state"), clock_);
-  EXPECT_FALSE(std::filesystem::exists(directory_.path("state"))) << "nothing was sent yet";
+  Bench spool(*this, directory_.path("state"), {});
   Payload payload;
   payload.set("Z", SharedString("first"));
   payload.set("A", Number{0.1f});
   payload.set("M", Number{true});
   payload.set("Text", SharedString("a\xff\"b"));
-  EXPECT_TRUE(spool.sendEvent("com.vantor.performance.tessel", payload));
+  EXPECT_TRUE(spool.queue("com.vantor.performance.tessel", payload));
+  EXPECT_FALSE(std::filesystem::exists(directory_.path("state"))) << "a send touches no disk";
   clock_.advance(std::chrono::microseconds{7});
-  EXPECT_TRUE(spool.sendEvent("ts__\xc3__", Payload{}));
+  EXPECT_TRUE(spool.send("ts__\xc3__", Payload{}));
 
   Reader reader(directory_.path("state"));
   EXPECT_THAT(reader.rows(),
@@ -95,14 +132,15 @@ TEST_F(SpoolTest, RowsStandInSendOrder) {
                           "1795000000000007 ts__\xef\xbf\xbd__ {}"));
   EXPECT_EQ(reader.database().text("PRAGMA journal_mode"), "wal");
   EXPECT_EQ(reader.database().integer("SELECT length(value) FROM meta WHERE key='spool_id'"), 32);
-  EXPECT_EQ(spool.figures().stored, 2u);
+  EXPECT_EQ(spool.endRun().stored, 2u);
+  EXPECT_EQ(status_.steps, 2u) << "a row is progress";
   EXPECT_TRUE(log_.lines().empty());
 }
 
 TEST_F(SpoolTest, TheGroupMayWriteIt) {
   const mode_t before = ::umask(0007);
-  Spool spool(directory_.path(), clock_);
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  Bench spool = bench();
+  EXPECT_TRUE(spool.send("a", numbered(1)));
   ::umask(before);
   using std::filesystem::perms;
   const perms shared =
@@ -112,44 +150,78 @@ TEST_F(SpoolTest, TheGroupMayWriteIt) {
   }
 }
 
-TEST_F(SpoolTest, ALaterProcessGoesOn) {
+TEST_F(SpoolTest, ALaterProcessGoesOnAndARemovedSpoolIsMadeAnew) {
   std::optional<std::string> id;
   for (int64_t run = 1; run <= 3; ++run) {
-    Spool spool(directory_.path(), clock_);
-    EXPECT_TRUE(spool.sendEvent("a", numbered(run)));
+    Bench spool = bench();
+    EXPECT_TRUE(spool.send("a", numbered(run)));
     Reader reader(directory_.path());
     EXPECT_EQ(reader.count(), run);
     const auto found = reader.database().text("SELECT value FROM meta WHERE key='spool_id'");
     EXPECT_EQ(id.value_or(*found), *found);
     id = found;
   }
-}
-
-TEST_F(SpoolTest, ARemovedSpoolIsMadeAnew) {
-  Spool spool(directory_.path(), clock_);
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
-  spool.endRun();
+  Bench spool = bench();
+  EXPECT_TRUE(spool.send("a", numbered(4)));
+  EXPECT_EQ(spool.endRun().stored, 1u);
   std::filesystem::remove(directory_.path(kSpoolFileName));
-  spool.beginRun();
-  EXPECT_EQ(spool.figures().stored, 0u);
-  EXPECT_TRUE(spool.sendEvent("a", numbered(2)));
+  EXPECT_TRUE(spool.send("a", numbered(5)));
   EXPECT_EQ(Reader(directory_.path()).count(), 1);
+  EXPECT_EQ(spool.endRun().stored, 1u);
 }
 
-TEST_F(SpoolTest, ALockHoldsTheQueueOnceAndIsSaidOnce) {
-  Spool spool(directory_.path(), clock_);
-  ASSERT_TRUE(spool.sendEvent("a", numbered(0)));
+TEST_F(SpoolTest, RowsWaitForALockUntilTheRunEnds) {
+  Bench spool = bench();
+  ASSERT_TRUE(spool.send("a", numbered(0)));
   Reader other(directory_.path());
-  ASSERT_TRUE(other.database().execute("BEGIN IMMEDIATE").ok());
   const auto start = std::chrono::steady_clock::now();
-  for (int i = 0; i < 200; ++i) EXPECT_FALSE(spool.sendEvent("a", numbered(i)));
+  for (const bool released : {true, false}) {
+    ASSERT_TRUE(other.database().execute("BEGIN IMMEDIATE").ok());
+    for (int i = 1; i <= 200; ++i) EXPECT_TRUE(spool.send("a", numbered(i)));
+    spool.tick();
+    EXPECT_EQ(other.count(), 1);
+    if (released) other.database().execute("COMMIT");
+    const SpoolFigures figures = spool.endRun();
+    if (!released) other.database().execute("COMMIT");
+    EXPECT_EQ(failures(figures, SpoolFailure::locked), released ? 0u : 200u);
+    EXPECT_EQ(other.count(), released ? 201 : 1);
+    ASSERT_TRUE(other.database().execute("DELETE FROM events WHERE id > 1").ok());
+  }
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(20))
-      << "waited more than once";
-  ASSERT_TRUE(other.database().execute("COMMIT").ok());
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
-  EXPECT_EQ(failures(spool, SpoolFailure::locked), 200u);
+      << "few waits a run";
   EXPECT_EQ(log_.lines().size(), 1u);
-  EXPECT_EQ(other.count(), 2);
+  EXPECT_EQ(readSpoolTotals(other.database())->refused[size_t(SpoolFailure::locked)], 0u)
+      << "it was locked";
+  EXPECT_TRUE(spool.send("a", numbered(1)));
+  spool.endRun();
+  EXPECT_EQ(readSpoolTotals(other.database())->refused[size_t(SpoolFailure::locked)], 200u);
+}
+
+TEST_F(SpoolTest, ThreadsLoseNoRow) {
+  WorkerQueueFactory timers;
+  Spool spool(directory_.path(), {}, clock_, status_,
+              std::make_shared<WorkerQueue>("writer", QueueThread::own), timers);
+  for (int run = 1; run <= 20; ++run) {
+    for (int i = 0; i < 200; ++i) spool.sendEvent("a", numbered(i), EventRank::object);
+    EXPECT_EQ(spool.endRun().stored, 200u);
+    EXPECT_EQ(Reader(directory_.path()).count(), 200 * run);
+  }
+}
+
+TEST_F(SpoolTest, ABufferThatIsFullRefusesObjectsAlone) {
+  Bench spool = bench();
+  const Payload large = ofSize(100'000);
+  int taken = 0;
+  while (spool.queue("a", large)) ASSERT_LT(++taken, 1000);
+  EXPECT_EQ(taken, (16 << 20) / 100'012);
+  EXPECT_FALSE(spool.queue("a", large));
+  EXPECT_TRUE(spool.queue("b", large, EventRank::statistics));
+  EXPECT_EQ(spool.pending(), 1u) << "one job for all rows";
+  const SpoolFigures figures = spool.endRun();
+  EXPECT_EQ(figures.stored, static_cast<uint64_t>(taken) + 1);
+  EXPECT_EQ(failures(figures, SpoolFailure::bufferFull), 2u);
+  EXPECT_EQ(log_.lines().size(), 1u);
+  EXPECT_TRUE(spool.queue("a", large)) << "the buffer is empty again";
 }
 
 TEST_F(SpoolTest, AFailedSendHasItsReason) {
@@ -180,90 +252,135 @@ TEST_F(SpoolTest, AFailedSendHasItsReason) {
     SCOPED_TRACE(c.what);
     c.arrange();
     log_.clear();
-    Spool spool(directory_.path(), clock_);
-    EXPECT_FALSE(spool.sendEvent("a", numbered(1)));
-    EXPECT_FALSE(spool.sendEvent("a", numbered(2)));
-    EXPECT_EQ(failures(spool, c.reason), 2u);
+    Bench spool = bench();
+    spool.send("a", numbered(1));
+    spool.queue("a", numbered(2));
+    spool.send("a", numbered(3));
+    std::filesystem::remove_all(file);
+    EXPECT_TRUE(spool.send("a", numbered(4)));
+    const SpoolFigures figures = spool.endRun();
+    EXPECT_EQ(failures(figures, c.reason), 3u);
+    EXPECT_EQ(figures.stored, 1u) << "works again as soon as the cause is gone";
     EXPECT_EQ(log_.lines().size(), 1u);
     EXPECT_TRUE(filesWith("damaged").empty());
-    std::filesystem::remove_all(file);
-    EXPECT_TRUE(spool.sendEvent("a", numbered(3))) << "works again as soon as the cause is gone";
-    spool.endRun();
+    EXPECT_EQ(readSpoolTotals(Reader(directory_.path()).database())->refused[size_t(c.reason)], 3u);
     std::filesystem::remove_all(file);
   }
 }
 
-TEST_F(SpoolTest, PastTheLimitOldRowsStay) {
-  constexpr uint64_t kLimit = 1 << 20;
-  Spool spool(directory_.path(), clock_, kLimit);
-  uint64_t sent = 0;
-  while (spool.sendEvent("a", ofSize(10'000))) ASSERT_LT(++sent, 1000u);
-  EXPECT_FALSE(spool.sendEvent("a", ofSize(10'000)));
-  EXPECT_GT(sent, 80u) << "the limit is a size, not a handful";
-  EXPECT_EQ(failures(spool, SpoolFailure::limit), 2u);
-  EXPECT_EQ(log_.lines().size(), 1u);
-  spool.endRun();
-  EXPECT_LE(std::filesystem::file_size(directory_.path(kSpoolFileName)), kLimit);
-
+TEST_F(SpoolTest, ARunTakesItsShareAndASpoolItsLimit) {
+  Bench spool = bench(kSmall);
+  uint64_t stored = 0;
+  for (int run = 1; run <= 12; ++run) {
+    for (int i = 0; i < 200; ++i) spool.send("a", ofSize(10'000));
+    EXPECT_TRUE(spool.send("sum", numbered(run), EventRank::statistics));
+    const SpoolFigures figures = spool.endRun();
+    EXPECT_EQ(figures.stored + failures(figures, SpoolFailure::runShare) +
+                  failures(figures, SpoolFailure::limit),
+              201u);
+    const bool isFull = failures(figures, SpoolFailure::limit) != 0;
+    EXPECT_TRUE(run <= 8 ? !isFull : isFull || run < 12) << run;
+    EXPECT_LE(figures.stored * 3 * 4096, kSmall.bytes / 8) << run;
+    stored += figures.stored;
+  }
+  EXPECT_GT(stored, 500u) << "the limit is a size, not a handful";
+  EXPECT_LE(sizeOf(kSpoolFileName), kSmall.bytes);
   Reader reader(directory_.path());
-  EXPECT_EQ(reader.count(), static_cast<int64_t>(sent));
-  ASSERT_TRUE(reader.database().execute("DELETE FROM events WHERE id <= 10").ok());
-  spool.beginRun();
-  EXPECT_TRUE(spool.sendEvent("a", ofSize(10'000))) << "space that was given back is used again";
+  EXPECT_EQ(reader.database().integer("SELECT count(*) FROM events WHERE name='sum'"), 12)
+      << "the statistics of each run";
+  ASSERT_TRUE(reader.database().execute("DELETE FROM events WHERE id <= 100").ok());
+  for (int i = 0; i < 20; ++i) spool.send("a", ofSize(10'000));
+  EXPECT_EQ(spool.endRun().stored, 20u) << "space that was given back is used again";
 }
 
-TEST_F(SpoolTest, AnEndlessReaderCannotGrowTheLog) {
-  constexpr uint64_t kLimit = 4 << 20;
-  Spool spool(directory_.path(), clock_, kLimit);
-  ASSERT_TRUE(spool.sendEvent("a", numbered(0)));
+TEST_F(SpoolTest, RowsPastTheirDaysGo) {
+  Bench spool = bench(kSmall);
+  for (int i = 0; i < 70; ++i) spool.send("old", ofSize(10'000));
+  EXPECT_EQ(spool.endRun().expired, 0u);
+  clock_.advance(std::chrono::hours{24 * 29});
+  for (int i = 0; i < 10; ++i) spool.send("newer", ofSize(10'000));
+  EXPECT_EQ(spool.endRun().expired, 0u);
+  const uint64_t before = sizeOf(kSpoolFileName);
+  // A clock that was set back: an old row behind newer ones.
+  EXPECT_TRUE(Reader(directory_.path())
+                  .database()
+                  .execute("INSERT INTO events SELECT 81, time, name, payload FROM events "
+                           "WHERE id=1")
+                  .ok());
+  clock_.advance(std::chrono::hours{48});
+  EXPECT_EQ(spool.endRun().expired, 71u) << "a run that sends nothing removes them, too";
+  EXPECT_LT(sizeOf(kSpoolFileName), before / 5) << "the space is given back";
+  Reader reader(directory_.path());
+  EXPECT_EQ(reader.count(), 10);
+  EXPECT_EQ(readSpoolTotals(reader.database())->expired, 71u);
+
+  clock_.advance(std::chrono::hours{24 * 1000});
+  Bench keeping = bench({.bytes = kSmall.bytes, .days = std::chrono::days{0}});
+  EXPECT_EQ(keeping.endRun().expired, 0u);
+  EXPECT_EQ(reader.count(), 10);
+}
+
+TEST_F(SpoolTest, AReaderThatStaysCostsRowsOnlyAtTheLimit) {
+  Bench spool = bench(kSmall);
+  spool.send("a", numbered(0));
   Reader other(directory_.path());
+  const auto flood = [&] {
+    for (int i = 0; i < 90; ++i) {
+      for (int j = 0; j < 8; ++j) spool.queue("a", numbered(i));
+      spool.send("a", numbered(i));
+      spool.tick();
+    }
+    return spool.endRun();
+  };
   ASSERT_TRUE(other.database().execute("BEGIN; SELECT count(*) FROM events").ok());
-  for (int i = 0; i < 2000; ++i) spool.sendEvent("a", numbered(i));
-  EXPECT_GT(failures(spool, SpoolFailure::limit), 0u);
-  EXPECT_LE(std::filesystem::file_size(directory_.path("statora.db-wal")), kLimit / 8);
+  EXPECT_EQ(flood().stored, 90u * 9 + 1);
+  EXPECT_GT(sizeOf("statora.db-wal"), kSmall.bytes / 16);
+  uint64_t held = 0;
+  for (int run = 0; run < 20 && held == 0; ++run)
+    held = failures(flood(), SpoolFailure::heldByReader);
+  EXPECT_GT(held, 0u);
+  EXPECT_LE(sizeOf("statora.db-wal") + sizeOf(kSpoolFileName), kSmall.bytes);
   ASSERT_TRUE(other.database().execute("COMMIT").ok());
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  EXPECT_EQ(flood().stored, 90u * 9) << "as soon as the reader is gone";
+  EXPECT_LE(sizeOf("statora.db-wal"), kSmall.bytes / 16);
 }
 
 TEST_F(SpoolTest, ADamagedSpoolIsSetAside) {
   const std::string damage(8192, '\x5a');
   directory_.write(kSpoolFileName, damage);
   directory_.write("statora.db-wal", "its log");
-  Spool spool(directory_.path(), clock_);
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
+  Bench spool = bench();
+  EXPECT_TRUE(spool.send("a", numbered(1)));
   const std::string name = "statora.db.damaged-20261118T110640Z";
-  EXPECT_THAT(spool.figures().setAside, ElementsAre(name));
   EXPECT_THAT(log_.lines(), ElementsAre(HasSubstr(name)));
-  EXPECT_EQ(std::filesystem::file_size(directory_.path(name)), damage.size());
-  EXPECT_EQ(std::filesystem::file_size(directory_.path(name + "-wal")), 7u);
+  EXPECT_EQ(sizeOf(name), damage.size());
+  EXPECT_EQ(sizeOf(name + "-wal"), 7u);
   EXPECT_EQ(Reader(directory_.path()).count(), 1);
-  spool.endRun();
+  EXPECT_THAT(spool.endRun().setAside, ElementsAre(name));
 
   directory_.write(kSpoolFileName, damage);
-  EXPECT_FALSE(spool.sendEvent("a", numbered(2))) << "one a run, however bad the disk";
-  EXPECT_EQ(failures(spool, SpoolFailure::damaged), 1u);
-  spool.beginRun();
-  EXPECT_TRUE(spool.sendEvent("a", numbered(3)));
-  EXPECT_THAT(spool.figures().setAside, ElementsAre(name + "-2"))
+  spool.send("a", numbered(2));
+  EXPECT_THAT(spool.endRun().setAside, ElementsAre(name + "-2"))
       << "an older one is not overwritten";
 }
 
 TEST_F(SpoolTest, DamageCostsNoStoredRow) {
-  Spool spool(directory_.path(), clock_);
-  for (int i = 0; i < 300; ++i) ASSERT_TRUE(spool.sendEvent("a", ofSize(500)));
-  spool.endRun();
+  Bench spool = bench();
+  for (int i = 0; i < 300; ++i) ASSERT_TRUE(spool.send("a", ofSize(500)));
+  EXPECT_EQ(spool.endRun().stored, 300u);
   // Everything but the first page: the schema is read, the tables are not.
-  const auto size = std::filesystem::file_size(directory_.path(kSpoolFileName));
+  const auto size = sizeOf(kSpoolFileName);
   {
     std::fstream file(directory_.path(kSpoolFileName),
                       std::ios::in | std::ios::out | std::ios::binary);
     file.seekp(4096);
     file << std::string(size - 4096, '\x5a');
   }
-  EXPECT_TRUE(spool.sendEvent("a", numbered(1)));
-  ASSERT_EQ(spool.figures().setAside.size(), 1u);
-  EXPECT_EQ(std::filesystem::file_size(directory_.path(spool.figures().setAside[0])), size);
-  EXPECT_EQ(spool.figures().stored, 301u);
+  EXPECT_TRUE(spool.send("a", numbered(1)));
+  const SpoolFigures figures = spool.endRun();
+  ASSERT_EQ(figures.setAside.size(), 1u);
+  EXPECT_EQ(sizeOf(figures.setAside[0]), size);
+  EXPECT_EQ(figures.stored, 1u);
 }
 
 }  // namespace

@@ -80,7 +80,7 @@ uint64_t CountReporter::reportCountForKey(const TesselReporterAggregationKey& ke
     return count;
   }
   sender_.sendEvent("com.vantor.performance.tessel_counts",
-                    countPayload(key, count, classification_));
+                    countPayload(key, count, classification_), EventRank::count);
   ++sentCount_;
   tesselReporterLog().debug("%@:\t%llu (Count reported to Statora)", key, count);
   return count;
@@ -93,7 +93,8 @@ uint64_t RunSummary::reportRunSummary(const TesselReporterObjectFilter& filter, 
   const uint64_t countEvents = reportSections(filter);
   const float seconds = secondsSince(processingStartTime);
   sender_.sendEvent("com.vantor.performance.tessel_reporting_stats",
-                    runSummaryPayload(filter, logEvents, seconds, interruptedByDeferral));
+                    runSummaryPayload(filter, logEvents, seconds, interruptedByDeferral),
+                    EventRank::statistics);
   const LogHandle& log = tesselReporterLog();
   // log.debug() gets its arguments ready-made. We ask first whether the line is logged, so that
   // the two dates are not formatted in vain.

@@ -78,6 +78,16 @@ class FaultMachine(Machine):
     def run_faulty(self, environment=None, **faults):
         return self.result(self.start_faulty(environment, **faults))
 
+    def run_struck_at(self, at, **faults):
+        """A run that is struck at that call. How many rows share a transaction differs from run to run, and so does
+        the number of calls: where a run makes fewer, the next one is struck earlier."""
+        while True:
+            try:
+                return self.run_faulty(AT=at, **faults)
+            except NeverInjected:
+                self.forget_state()
+                at = max(1, at * 3 // 4)
+
     def result(self, process, timeout=120):
         result = super().result(process, timeout)
         if getattr(process, "tessel_faulty", False) and not os.path.exists(self.struck):

@@ -12,8 +12,10 @@
 //   FAULT_LINE     kills the process after it wrote this text to standard error
 //   FAULT_DURABLE  directory that receives a copy of each file whenever the file is flushed
 //   FAULT_CLOCK    file with the seconds by which the wall clock is wrong; it may appear at any time
-//   FAULT_HURRY    1: a wait of less than two seconds ends after a millisecond. The wall clock, the
-//                  clock since boot and the steady clock of that thread jump over the rest
+//   FAULT_SLOW     milliseconds that each flush takes
+//   FAULT_HURRY    1: a wait of one and a half to three seconds ends after a millisecond. The wall
+//                  clock, the clock since boot and the steady clock of that thread jump over the
+//                  rest
 //   FAULT_STRUCK   file that is made when the first fault strikes, so that a test can tell a
 //                  service that withstood its fault from one that never met it
 
@@ -168,7 +170,16 @@ int ftruncate64(int fd, off64_t length) {
   return REAL(ftruncate64)(fd, length);
 }
 
+static void takeTime(void) {
+  const long milliseconds = number("FAULT_SLOW", 0);
+  if (milliseconds == 0) return;
+  noteStrike();
+  const struct timespec time = {milliseconds / 1000, milliseconds % 1000 * 1000000};
+  syscall(SYS_nanosleep, &time, NULL);
+}
+
 int fsync(int fd) {
+  takeTime();
   if (struckFd("fsync", fd)) return -1;
   const int result = REAL(fsync)(fd);
   keepDurable(fd);
@@ -176,6 +187,7 @@ int fsync(int fd) {
 }
 
 int fdatasync(int fd) {
+  takeTime();
   if (struckFd("fdatasync", fd)) return -1;
   const int result = REAL(fdatasync)(fd);
   keepDurable(fd);
@@ -255,8 +267,10 @@ int pthread_cond_clockwait(pthread_cond_t* condition, pthread_mutex_t* mutex, cl
   syscall(SYS_clock_gettime, clock, &now);
   const long deadline = nanoseconds(until) - skippedHere;
   const long remaining = deadline - nanoseconds(&now);
-  const int hurried = number("FAULT_HURRY", 0) != 0 && remaining > kMillisecond &&
-                      remaining < 2L * kSecond;
+  // Not the timer of the spool's flushes, which comes once a second: its jumps would hurry the
+  // polls of past runs, which have the same thread.
+  const int hurried = number("FAULT_HURRY", 0) != 0 && remaining > 1500L * kMillisecond &&
+                      remaining < 3L * kSecond;
   const struct timespec end = timespecOf(hurried ? nanoseconds(&now) + kMillisecond : deadline);
   const int result = REAL(pthread_cond_clockwait)(condition, mutex, clock, &end);
   if (hurried && result == ETIMEDOUT) {

@@ -147,7 +147,7 @@ struct SentEvent {
 
 // An analytics service that remembers.
 struct RememberingSender final : EventSender {
-  bool sendEvent(std::string_view name, const Payload& payload) override {
+  bool sendEvent(std::string_view name, const Payload& payload, EventRank /*rank*/) override {
     events.push_back({std::string(name), payloadJson(payload)});
     return true;
   }

@@ -1,0 +1,357 @@
+// Writing the spool's database: how rows become safe, and how its size stays within the limit.
+//
+// The choice. SQLite's write-ahead log with synchronous=NORMAL: a commit appends to the log and
+// flushes nothing. flush() flushes the log's file through SQLite's own handle, and its caller does
+// that once a second.
+//  - A kill at any moment loses no inserted row. The kernel keeps the written pages, and SQLite
+//    drops an unfinished transaction when the spool is next opened.
+//  - A power cut loses at most what was inserted since the last flush. SQLite reads the log up to
+//    the first page whose checksum is wrong. So an end of the log is lost, never a row between two.
+//  - The database itself is always sound. A checkpoint flushes the log before it changes a page of
+//    the database, and the database before the log may begin anew. So no page in the database is
+//    newer than the log on the disk.
+// The price: the ids of lost rows are given again, to other events. Nobody else may have seen the
+// lost rows as delivered, so the forwarder flushes the log before it sends. And a failed flush puts
+// all rows since the last flush at risk. They are counted as failed, for the kernel forgets which
+// pages it could not write, and a second flush would succeed without writing them.
+//
+// What was discarded. synchronous=FULL flushes for each transaction: on a disk that needs 40 ms for
+// a flush, 80 rows a second do not get through. One transaction a second would need no flush of our
+// own, but readers would see rows late, and a kill would lose a second. SQLite's rollback journal
+// flushes several times a transaction, and a reader makes the writer wait.
+
+#include "statora/SpoolDatabase.h"
+
+#include <sqlite3.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <limits>
+#include <utility>
+#include <vector>
+
+namespace tessel {
+
+namespace {
+
+constexpr int64_t kPageBytes = 4096;
+// What SQLite stores beside the text of a row: id, time, lengths, and the row's place in its page.
+constexpr uint64_t kBytesBesideText = 24;
+// Bytes of rows in a page of a table, and in a page that continues a long row.
+constexpr uint64_t kRowBytesInPage = kPageBytes - 12;
+constexpr uint64_t kRowBytesInOverflowPage = kPageBytes - 4;
+// Pages that an insert may write beside those of the row: where a page of the tree is split, and
+// the table that remembers the last id.
+constexpr int64_t kPagesBesideRow = 3;
+
+// A checkpoint costs three flushes, so it comes once in 16 MiB of log. Every reader looks through
+// the log, so a much longer one would slow the readers down.
+constexpr int64_t kCheckpointPages = 4000;
+// A spool with a small limit must not spend all of it on the log.
+constexpr int64_t kLeastCheckpointPages = 16;
+constexpr int64_t kLogShare = 32;
+
+// One run may take an eighth of the limit. So a flood of one day leaves room for a week.
+constexpr uint64_t kRunShare = 8;
+
+// The patience of one insert. The rows wait in memory and are tried again each second, so a long
+// wait would win nothing.
+constexpr std::chrono::milliseconds kPatience{250};
+
+// A step of removing holds the lock for as long as it takes to clear these rows, at most 130 KiB
+// each.
+constexpr int64_t kRowsExpiredAtOnce = 32;
+constexpr int kPagesVacuumedAtOnce = 256;
+// Rows stand in the order of sending. Where the clock was set, old rows may stand behind newer
+// ones, so the search goes on for so many rows. To read the whole spool would take seconds.
+constexpr size_t kNewerRowsLookedAt = 16384;
+
+// Bytes of pages that such rows take one after another. A page holds as many short rows as fit; a
+// long row has pages of its own.
+uint64_t spaceOf(size_t textBytes) {
+  const uint64_t bytes = textBytes + kBytesBesideText;
+  if (bytes <= kRowBytesInPage) return kPageBytes / (kRowBytesInPage / bytes);
+  return (bytes / kRowBytesInOverflowPage + 1) * kPageBytes;
+}
+
+// Pages that a row must leave free, for those of a higher rank. The events of the counts are at
+// most 30 a run, and their text seldom fills a page; a row of statistics is shorter than a page.
+int64_t pagesKeptFrom(EventRank rank, int64_t maxPages) {
+  constexpr int64_t kForStatistics = 2 + kPagesBesideRow;
+  if (rank == EventRank::statistics) return 0;
+  if (rank == EventRank::count) return kForStatistics;
+  return kForStatistics + std::clamp<int64_t>(maxPages / 64, 8, 256);
+}
+
+int64_t valueOf(SqliteStatement& statement) {
+  const bool read = statement.step() == SqliteStatement::Step::row;
+  const int64_t value = read ? statement.integer(0) : 0;
+  statement.reset();
+  return value;
+}
+
+}  // namespace
+
+SpoolDatabase::SpoolDatabase(std::string stateDirectory, SpoolLimits limits)
+    : directory_(std::move(stateDirectory)),
+      path_(directory_ + "/" + kSpoolFileName),
+      limits_(limits),
+      maxPages_(static_cast<int64_t>(limits.bytes) / kPageBytes),
+      checkpointPages_(
+          std::clamp<int64_t>(maxPages_ / kLogShare, kLeastCheckpointPages, kCheckpointPages)),
+      patience_(kPatience) {}
+
+bool SpoolDatabase::exists() const {
+  std::error_code ignored;  // a path that cannot be looked at holds nothing for us
+  return std::filesystem::exists(path_, ignored);
+}
+
+void SpoolDatabase::setPatience(std::chrono::milliseconds patience) {
+  patience_ = patience;
+  if (database_.isOpen()) database_.setBusyTimeout(static_cast<int>(patience_.count()));
+}
+
+void SpoolDatabase::beginRun() {
+  firstIdOfRun_ = 0;
+  takenByRun_ = 0;
+  refusedForLog_ = false;
+  setPatience(kPatience);
+}
+
+SqliteStatus SpoolDatabase::ensureOpen() {
+  if (isOpen()) return {};
+  SqliteStatus status = open();
+  if (!status.ok()) {
+    forgetStatements();
+    database_.abandon();
+  }
+  return status;
+}
+
+SqliteStatus SpoolDatabase::open() {
+  std::error_code ignored;  // opening the database fails next, with a better reason
+  std::filesystem::create_directories(directory_, ignored);
+  SqliteStatus status = openSpoolDatabase(database_, path_, static_cast<int>(patience_.count()));
+  if (!status.ok()) return status;
+  // journal_size_limit cuts the log's file down after a reader let it grow.
+  status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA journal_size_limit=" +
+                             std::to_string(checkpointPages_ * kPageBytes));
+  if (!status.ok()) return status;
+  logPages_ = 0;
+  nextCheckpoint_ = checkpointPages_;
+  sqlite3_wal_hook(database_.handle(), &SpoolDatabase::afterCommit, this);
+  if (firstIdOfRun_ == 0) {
+    const auto last = database_.integer("SELECT seq FROM sqlite_sequence WHERE name='events'");
+    firstIdOfRun_ = last.value_or(0) + 1;
+  }
+  pageCount_ = database_.prepare("PRAGMA page_count", true);
+  freePages_ = database_.prepare("PRAGMA freelist_count", true);
+  total_ = database_.prepare(
+      "INSERT INTO meta VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET value = value + ?2", true);
+  insert_ = database_.prepare("INSERT INTO events(time, name, payload) VALUES(?1, ?2, ?3)", true);
+  const bool good = pageCount_.prepared() && freePages_.prepared() && total_.prepared();
+  return good && insert_.prepared() ? SqliteStatus{} : database_.status();
+}
+
+void SpoolDatabase::forgetStatements() {
+  for (SqliteStatement* statement : {&insert_, &pageCount_, &freePages_, &total_}) *statement = {};
+}
+
+void SpoolDatabase::close() {
+  forgetStatements();
+  database_.close();
+  unflushed_ = false;
+  unflushedRows_ = 0;
+}
+
+SqliteStatus SpoolDatabase::insert(std::span<PendingRow> rows) {
+  if (SqliteStatus opened = ensureOpen(); !opened.ok()) return opened;
+  if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
+  const uint64_t takenBefore = takenByRun_;
+  pagesOfInsert_ = 0;
+  SqliteStatus status = insertEach(rows);
+  if (status.ok()) status = database_.execute("COMMIT");
+  if (!status.ok()) {
+    database_.execute("ROLLBACK");
+    takenByRun_ = takenBefore;
+    return status;
+  }
+  unflushedRows_ += static_cast<uint64_t>(
+      std::count_if(rows.begin(), rows.end(), [](const PendingRow& row) { return !row.refused; }));
+  if (logPages_ >= nextCheckpoint_) checkpoint();
+  return {};
+}
+
+SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
+  for (PendingRow& row : rows) {
+    row.refused = refusal(row);
+    if (row.refused) continue;
+    insert_.bind(1, row.time).bind(2, row.name).bind(3, *row.payload);
+    if (!insert_.run()) return database_.status();
+    takenByRun_ += spaceOf(row.textBytes());
+  }
+  return {};
+}
+
+// The limit holds for the pages in use and the log together. A reader that stays makes the log grow
+// although its pages will also go into the database, so both are counted. Twice the usual log is
+// never given to rows: the log needs it between two checkpoints.
+std::optional<SpoolFailure> SpoolDatabase::refusal(const PendingRow& row) {
+  const uint64_t space = spaceOf(row.textBytes());
+  const int64_t kept = pagesKeptFrom(row.rank, maxPages_);
+  const uint64_t share = limits_.bytes / kRunShare;
+  if (row.rank != EventRank::statistics &&
+      takenByRun_ + space + static_cast<uint64_t>(kept * kPageBytes) > share) {
+    return SpoolFailure::runShare;
+  }
+  const int64_t needed = static_cast<int64_t>(space) / kPageBytes + kPagesBesideRow;
+  const int64_t room = maxPages_ - (valueOf(pageCount_) - valueOf(freePages_)) - kept - needed;
+  if (room < 2 * checkpointPages_) return SpoolFailure::limit;
+  if (logIsHeld() && room < logPages_ + pagesOfInsert_ + needed) {
+    refusedForLog_ = true;
+    return SpoolFailure::heldByReader;
+  }
+  pagesOfInsert_ += needed;
+  return {};
+}
+
+// SQLite calls this after each commit, with the number of pages in the log. It takes the place of
+// SQLite's own automatic checkpoint.
+int SpoolDatabase::afterCommit(void* self, sqlite3* /*handle*/, const char* /*schema*/,
+                               int logPages) {
+  auto& database = *static_cast<SpoolDatabase*>(self);
+  database.logPages_ = logPages;
+  database.unflushed_ = true;
+  return SQLITE_OK;
+}
+
+// RESTART without a wait moves the pages that no reader needs. It succeeds if the next commit will
+// begin the log anew. Otherwise a reader has kept some pages, and the next checkpoint comes after
+// as many pages again: one at each commit would flush each time.
+void SpoolDatabase::checkpoint() {
+  database_.setBusyTimeout(0);
+  const int code = sqlite3_wal_checkpoint_v2(database_.handle(), nullptr, SQLITE_CHECKPOINT_RESTART,
+                                             nullptr, nullptr);
+  database_.setBusyTimeout(static_cast<int>(patience_.count()));
+  if (code == SQLITE_IOERR_FSYNC) rowsAtRisk_ += std::exchange(unflushedRows_, 0);
+  if (code == SQLITE_OK) {
+    logPages_ = 0;
+    // To move the pages, the checkpoint has flushed the log.
+    unflushed_ = false;
+    unflushedRows_ = 0;
+  }
+  nextCheckpoint_ = logPages_ + checkpointPages_;
+}
+
+void SpoolDatabase::retryHeldLog() {
+  if (isOpen() && std::exchange(refusedForLog_, false)) checkpoint();
+}
+
+SqliteStatus SpoolDatabase::flush() {
+  if (!isOpen() || !std::exchange(unflushed_, false)) return {};
+  SqliteStatus status = database_.flushLog();
+  const uint64_t rows = std::exchange(unflushedRows_, 0);
+  if (!status.ok()) rowsAtRisk_ += rows;
+  return status;
+}
+
+uint64_t SpoolDatabase::takeRowsAtRisk() { return std::exchange(rowsAtRisk_, 0); }
+
+bool SpoolDatabase::mayGrowLog() {
+  return !logIsHeld() || valueOf(pageCount_) + logPages_ + 2 * checkpointPages_ < maxPages_;
+}
+
+uint64_t SpoolDatabase::expire(Date now, const std::function<void()>& progress) {
+  if (!exists() || !ensureOpen().ok()) return 0;
+  uint64_t removed = 0;
+  if (limits_.days.count() != 0) {
+    const int64_t oldest = (now - limits_.days).time_since_epoch().count();
+    Search search{.oldest = oldest};
+    while (search.newerRows < kNewerRowsLookedAt && mayGrowLog() && expireNext(search)) progress();
+    removed = search.removed;
+  }
+  giveSpaceBack(progress);
+  return removed;
+}
+
+// SQLite uses free pages again, but shortens the file only when asked. A VACUUM would copy the
+// whole file under the lock. Some databases cannot give back a page, so the number must shrink each
+// time.
+void SpoolDatabase::giveSpaceBack(const std::function<void()>& progress) {
+  const std::string step =
+      "PRAGMA incremental_vacuum(" + std::to_string(kPagesVacuumedAtOnce) + ")";
+  int64_t before = std::numeric_limits<int64_t>::max();
+  for (int64_t free = valueOf(freePages_); free > 0 && free < before && mayGrowLog();
+       free = valueOf(freePages_)) {
+    before = free;
+    if (!database_.execute(step).ok()) return;
+    if (logPages_ >= nextCheckpoint_) checkpoint();
+    progress();
+  }
+}
+
+// Looks at the next rows and removes the old ones among them. False at the end of the table, and
+// where it fails.
+bool SpoolDatabase::expireNext(Search& search) {
+  std::vector<int64_t> old;
+  size_t seen = 0;
+  SqliteStatement look = database_.prepare(
+      "SELECT id, time FROM events WHERE id > ?1 AND id < ?2 ORDER BY id LIMIT ?3");
+  if (!look.prepared()) return false;
+  look.bind(1, search.after).bind(2, firstIdOfRun_).bind(3, kRowsExpiredAtOnce);
+  for (; look.step() == SqliteStatement::Step::row; ++seen) {
+    search.after = look.integer(0);
+    if (look.integer(1) < search.oldest) old.push_back(search.after);
+  }
+  // The statement would hold a read open while we write, and the log could not begin anew.
+  look = {};
+  search.newerRows = old.empty() ? search.newerRows + seen : 0;
+  if (!old.empty()) {
+    const std::optional<int64_t> removed = remove(old);
+    if (!removed) return false;
+    search.removed += static_cast<uint64_t>(*removed);
+  }
+  return seen != 0;
+}
+
+// Answers how many of the rows were still there.
+std::optional<int64_t> SpoolDatabase::remove(std::span<const int64_t> ids) {
+  SqliteStatement remove = database_.prepare("DELETE FROM events WHERE id=?1");
+  if (!remove.prepared() || !database_.execute("BEGIN IMMEDIATE").ok()) return {};
+  int64_t removed = 0;
+  bool good = std::all_of(ids.begin(), ids.end(), [&](int64_t id) {
+    const bool done = remove.bind(1, id).run();
+    removed += database_.changes();  // the forwarder may have removed it meanwhile
+    return done;
+  });
+  good = good && addTotal(kExpiredTotalKey, removed) && database_.execute("COMMIT").ok();
+  if (!good) database_.execute("ROLLBACK");
+  if (logPages_ >= nextCheckpoint_) checkpoint();
+  return good ? std::optional(removed) : std::nullopt;
+}
+
+bool SpoolDatabase::addTotal(std::string_view key, int64_t count) {
+  return total_.bind(1, key).bind(2, count).run();
+}
+
+bool SpoolDatabase::addRefused(const SpoolFailures& refused) {
+  if (!isOpen() || !database_.execute("BEGIN IMMEDIATE").ok()) return false;
+  bool good = true;
+  for (size_t kind = 0; kind < kSpoolFailureKinds; ++kind) {
+    const std::string key = refusedTotalKey(static_cast<SpoolFailure>(kind));
+    if (refused[kind] != 0) good = good && addTotal(key, static_cast<int64_t>(refused[kind]));
+  }
+  good = good && database_.execute("COMMIT").ok();
+  if (!good) database_.execute("ROLLBACK");
+  return good;
+}
+
+// abandon() and not close(): a checkpoint would write into the damaged file.
+std::optional<std::string> SpoolDatabase::setAside(Date now) {
+  forgetStatements();
+  database_.abandon();
+  firstIdOfRun_ = 0;  // the new one begins with 1
+  return setSpoolAside(directory_, now);
+}
+
+}  // namespace tessel

@@ -1,0 +1,118 @@
+// SpoolDatabase: the spool's database as the service writes it. Rows, flushes, checkpoints, the
+// limit on its size, and the rows that have stood there too long.
+//
+// Threads: one at a time.
+
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+
+#include "platform/Analytics.h"
+#include "platform/System.h"
+#include "statora/SpoolFile.h"
+#include "statora/Sqlite.h"
+
+namespace tessel {
+
+struct SpoolLimits {
+  uint64_t bytes = uint64_t{1} << 30;  // of the database and its write-ahead log together
+  std::chrono::days days{30};          // how long a row may stay; zero: for ever
+};
+
+// A row on its way into the spool. The two events of an object share one payload.
+struct PendingRow {
+  int64_t time = 0;  // microseconds since 1970
+  std::string name;
+  std::shared_ptr<const std::string> payload;
+  EventRank rank = EventRank::object;
+  std::optional<SpoolFailure> refused;  // set by insert() if there was no room
+
+  size_t textBytes() const { return name.size() + payload->size(); }
+};
+
+class SpoolDatabase {
+ public:
+  SpoolDatabase(std::string stateDirectory, SpoolLimits limits);
+
+  const std::string& path() const { return path_; }
+  bool isOpen() const { return insert_.prepared(); }
+  // Whether there is a database at the path.
+  bool exists() const;
+
+  // Inserts the rows in one transaction. A row for which there is no room is left out and gets its
+  // `refused`. After a failure none of the rows is in the database. Opens it if necessary.
+  SqliteStatus insert(std::span<PendingRow> rows);
+  // How long a transaction may wait for another client's lock; a quarter of a second by default.
+  void setPatience(std::chrono::milliseconds patience);
+  // Whether a reader keeps the log from beginning anew. Each commit then makes it longer.
+  bool logIsHeld() const { return logPages_ > 2 * checkpointPages_; }
+  // If rows were refused because the log is held, tries to empty it.
+  void retryHeldLog();
+
+  // Makes all inserted rows survive a power cut. Cheap if nothing was inserted.
+  SqliteStatus flush();
+  // How many inserted rows a failed flush or checkpoint has put at risk since the last call.
+  uint64_t takeRowsAtRisk();
+
+  // Removes the rows of earlier runs that are older than the limit on `now`, and gives free space
+  // back to the file system. Answers how many rows were removed. `progress` is called at each step.
+  uint64_t expire(Date now, const std::function<void()>& progress);
+  // Adds to the totals in the database. False if that failed, or if the database is not open.
+  bool addRefused(const SpoolFailures& refused);
+
+  // Begins the books of the next run.
+  void beginRun();
+  // Closes the database, which moves the log into it. Flush it before.
+  void close();
+  // Renames the database. Answers its new file name; absent if that failed.
+  std::optional<std::string> setAside(Date now);
+
+ private:
+  struct Search {
+    int64_t oldest = 0;    // microseconds since 1970; a row of an earlier time is removed
+    int64_t after = 0;     // id of the last row looked at
+    size_t newerRows = 0;  // looked at since the last old one
+    uint64_t removed = 0;
+  };
+
+  SqliteStatus ensureOpen();
+  SqliteStatus open();
+  void forgetStatements();
+  SqliteStatus insertEach(std::span<PendingRow> rows);
+  std::optional<SpoolFailure> refusal(const PendingRow& row);
+  void checkpoint();
+  bool expireNext(Search& search);
+  std::optional<int64_t> remove(std::span<const int64_t> ids);
+  void giveSpaceBack(const std::function<void()>& progress);
+  bool addTotal(std::string_view key, int64_t count);
+  bool mayGrowLog();
+  static int afterCommit(void* self, sqlite3* handle, const char* schema, int logPages);
+
+  const std::string directory_;
+  const std::string path_;
+  const SpoolLimits limits_;
+  const int64_t maxPages_;
+  const int64_t checkpointPages_;
+
+  SqliteDatabase database_;
+  SqliteStatement insert_, pageCount_, freePages_, total_;
+  std::chrono::milliseconds patience_;
+  int64_t firstIdOfRun_ = 0;    // 0 until the run has opened the database
+  uint64_t takenByRun_ = 0;     // bytes of pages
+  int64_t pagesOfInsert_ = 0;   // of the transaction under way
+  int64_t logPages_ = 0;        // after the last commit; 0 if the next one begins the log anew
+  int64_t nextCheckpoint_ = 0;  // the length of the log at which it is due
+  bool refusedForLog_ = false;
+  uint64_t unflushedRows_ = 0;
+  bool unflushed_ = false;
+  uint64_t rowsAtRisk_ = 0;
+};
+
+}  // namespace tessel

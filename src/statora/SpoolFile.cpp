@@ -1,0 +1,144 @@
+// The spool as a file: its schema, its totals, and renaming a damaged one.
+
+#include "statora/SpoolFile.h"
+
+#include <sqlite3.h>
+
+#include <ctime>
+#include <filesystem>
+#include <iterator>
+
+#include "os/Files.h"
+
+namespace tessel {
+
+namespace {
+
+// Step N brings a spool of version N to version N + 1. A step only adds, so that a forwarder of the
+// version before can still deliver the rows.
+//
+// AUTOINCREMENT never gives an id twice, even after the row was delivered and removed. The
+// forwarder needs that, because spool_id and id together are the identifier of an event.
+constexpr const char* kUpgrades[] = {
+    "CREATE TABLE events(id INTEGER PRIMARY KEY AUTOINCREMENT, time INTEGER NOT NULL,"
+    " name TEXT NOT NULL, payload TEXT NOT NULL);"
+    "CREATE TABLE meta(key TEXT PRIMARY KEY, value TEXT NOT NULL) WITHOUT ROWID;"
+    "INSERT INTO meta VALUES('spool_id', lower(hex(randomblob(16))));",
+};
+static_assert(std::size(kUpgrades) == kSpoolSchemaVersion);
+
+SqliteStatus upgrade(SqliteDatabase& database) {
+  // The version is read again under the lock, because two processes may find the same new spool.
+  if (SqliteStatus begun = database.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
+  const auto version = database.integer("PRAGMA user_version");
+  SqliteStatus status = version ? SqliteStatus{} : database.status();
+  for (int64_t step = version.value_or(kSpoolSchemaVersion);
+       status.ok() && step < kSpoolSchemaVersion; ++step) {
+    status = database.execute(kUpgrades[step]);
+  }
+  if (status.ok())
+    status = database.execute("PRAGMA user_version=" + std::to_string(kSpoolSchemaVersion));
+  if (status.ok()) status = database.execute("COMMIT");
+  if (!status.ok()) database.execute("ROLLBACK");
+  return status;
+}
+
+// The forwarder is another user of the same group and must write to the spool. SQLite would make
+// the file without write permission for the group, so we make it first. SQLite then gives the log
+// and the index of the log the same mode.
+//
+// This never opens an existing file. When a process closes any descriptor of a file, POSIX drops
+// all its locks on that file, and an open database would lose its locks in that way.
+void makeFile(const std::string& path) { createNewFile(path, 0660); }
+
+SqliteStatus prepareSchema(SqliteDatabase& database) {
+  const auto version = database.integer("PRAGMA user_version");
+  if (!version) return database.status();
+  if (*version == kSpoolSchemaVersion) return {};
+  if (*version > kSpoolSchemaVersion || *version < 0) {
+    return {SQLITE_SCHEMA, "made by another version (schema " + std::to_string(*version) + ")"};
+  }
+  // auto_vacuum lets the forwarder give the space of delivered rows back in small steps. It can
+  // only be set before the first table exists, so it comes first.
+  SqliteStatus status = database.execute("PRAGMA auto_vacuum=INCREMENTAL; PRAGMA journal_mode=WAL");
+  return status.ok() ? upgrade(database) : status;
+}
+
+}  // namespace
+
+SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
+                               int busyTimeoutMilliseconds) {
+  makeFile(path);
+  SqliteStatus status = database.open(path, SqliteDatabase::Mode::create);
+  if (!status.ok()) return status;
+  database.setBusyTimeout(busyTimeoutMilliseconds);
+  status = prepareSchema(database);
+  // A spool of a newer version must stay as it is. A normal close would write its log back.
+  if (!status.ok()) database.abandon();
+  return status;
+}
+
+namespace {
+
+std::string utcStamp(Date date) {
+  const std::time_t seconds =
+      std::chrono::duration_cast<std::chrono::seconds>(date.time_since_epoch()).count();
+  std::tm parts{};
+  gmtime_r(&seconds, &parts);
+  char text[32];
+  return {text, std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &parts)};
+}
+
+// The log is renamed first. If the database went first and the process died then, the log would
+// stay alone under the old name, and SQLite would play it into the new database.
+bool renameAll(const std::string& from, const std::string& to) {
+  for (const char* suffix : {"-wal", "", "-shm"}) {
+    std::error_code error;
+    std::filesystem::rename(from + suffix, to + suffix, error);
+    if (error && error != std::errc::no_such_file_or_directory) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+std::optional<std::string> setSpoolAside(const std::string& stateDirectory, Date now) {
+  const std::string stem = std::string(kSpoolFileName) + ".damaged-" + utcStamp(now);
+  std::string name = stem;
+  std::error_code error;
+  for (int again = 2; std::filesystem::exists(stateDirectory + "/" + name, error); ++again) {
+    name = stem + "-" + std::to_string(again);  // an earlier damaged spool is evidence, too
+  }
+  const std::string path = stateDirectory + "/" + kSpoolFileName;
+  if (error || !renameAll(path, stateDirectory + "/" + name)) return {};
+  flushDirectory(stateDirectory);
+  return name;
+}
+
+const char* spoolFailureName(SpoolFailure failure) {
+  constexpr const char* kNames[kSpoolFailureKinds] = {
+      "limit",   "disk_full", "read_only",   "locked",    "damaged",
+      "version", "other",     "buffer_full", "run_share", "held_by_reader"};
+  return kNames[static_cast<size_t>(failure)];
+}
+
+std::string refusedTotalKey(SpoolFailure failure) {
+  return std::string("refused_") + spoolFailureName(failure);
+}
+
+std::optional<SpoolTotals> readSpoolTotals(SqliteDatabase& database) {
+  SqliteStatement select = database.prepare("SELECT key, CAST(value AS INTEGER) FROM meta");
+  if (!select.prepared()) return {};
+  SpoolTotals totals;
+  while (select.step() == SqliteStatement::Step::row) {
+    const std::string_view key = select.text(0);
+    const auto value = static_cast<uint64_t>(select.integer(1));
+    if (key == kExpiredTotalKey) totals.expired = value;
+    for (size_t kind = 0; kind < kSpoolFailureKinds; ++kind) {
+      if (key == refusedTotalKey(static_cast<SpoolFailure>(kind))) totals.refused[kind] = value;
+    }
+  }
+  return totals;
+}
+
+}  // namespace tessel
