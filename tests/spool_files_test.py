@@ -95,6 +95,32 @@ class Schema(SpoolTest):
         with self.database() as database:
             self.assertEqual(database.execute("SELECT count(*) FROM stolen").fetchone(), (0,))
 
+    def test_tables_of_another_shape_are_set_aside(self):
+        for tampering in ("ALTER TABLE events ADD COLUMN more TEXT CHECK (id < 9)",
+                          "CREATE UNIQUE INDEX one ON events((id < 0)) WHERE id > 8",
+                          "CREATE INDEX slow ON events(length(zeroblob(id * 1000000)))",
+                          "ALTER TABLE events RENAME TO kept; CREATE VIEW events AS SELECT * FROM kept",
+                          "DROP TABLE events", "DELETE FROM meta", "DROP TABLE meta",
+                          "UPDATE sqlite_sequence SET seq = 9223372036854775807",
+                          "PRAGMA writable_schema=ON; UPDATE sqlite_schema SET sql='CREATE TABLE events(' WHERE name='events'"):
+            with self.subTest(tampering):
+                with self.database() as database:
+                    database.executescript(tampering)
+                self.run_clean()
+                self.assertEqual(len(self.machine.rows()), self.rows)
+                aside = [name for name in os.listdir(self.machine.state) if name.startswith("statora.db.damaged")]
+                self.assertEqual(len([name for name in aside if name.endswith("Z")]), 1)
+                self.assertEqual(self.machine.ctl("status").status, 0)
+                for name in aside:
+                    os.unlink(os.path.join(self.machine.state, name))
+
+    def test_the_log_is_turned_on_again(self):
+        with self.database() as database:
+            database.execute("PRAGMA journal_mode=DELETE")
+        self.run_clean()
+        with self.database() as database:
+            self.assertEqual(database.execute("PRAGMA journal_mode").fetchone(), ("wal",))
+
 
 class Readers(SpoolTest):
     def test_a_pager_that_is_left_open_holds_nothing(self):

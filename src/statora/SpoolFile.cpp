@@ -27,6 +27,35 @@ constexpr const char* kUpgrades[] = {
 };
 static_assert(std::size(kUpgrades) == kSpoolSchemaVersion);
 
+// Whether the tables are those that the service made. Whoever may write to the spool can change
+// them. A further column that must not be null, a CHECK, a unique index, or a count of ids that is
+// at its end would then refuse every row, run after run. SQLite keeps the text of each statement
+// that made something, so we compare that text, without its spaces. Nothing else that stands in the
+// schema acts on our rows: triggers and views are turned off.
+constexpr char kIsOurs[] =
+    "SELECT count(*) = 2"
+    " AND NOT EXISTS (SELECT 1 FROM sqlite_schema WHERE type='index' AND sql IS NOT NULL"
+    "  AND tbl_name IN ('events', 'meta'))"
+    " AND EXISTS (SELECT 1 FROM meta WHERE key='spool_id' AND length(value) = 32)"
+    " AND (SELECT coalesce(max(id), 0) FROM events) < (1 << 62)"
+    " AND (SELECT coalesce(max(seq), 0) FROM sqlite_sequence WHERE name='events') < (1 << 62)"
+    " FROM sqlite_schema WHERE type='table' AND name IN ('events', 'meta')"
+    " AND instr(replace(?1, ' ', ''), replace(replace(sql, ' ', ''), char(10), '') || ';') <> 0";
+
+SqliteStatus checkShape(SqliteDatabase& database) {
+  SqliteStatement query = database.prepare(kIsOurs);
+  if (query.prepared() &&
+      query.bind(1, std::string_view(kUpgrades[0])).step() == SqliteStatement::Step::row &&
+      query.integer(0) == 1) {
+    return {};
+  }
+  const SqliteStatus failed = database.status();
+  // The query is right, so an error of the plain kind means that a table it names is missing or is
+  // no table.
+  if (!failed.ok() && failed.primaryCode() != SQLITE_ERROR) return failed;
+  return {SQLITE_CORRUPT, "its tables are not those that the service made"};
+}
+
 SqliteStatus upgrade(SqliteDatabase& database) {
   // The version is read again under the lock, because two processes may find the same new spool.
   if (SqliteStatus begun = database.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
@@ -54,7 +83,12 @@ void makeFile(const std::string& path) { createNewFile(path, 0660); }
 SqliteStatus prepareSchema(SqliteDatabase& database) {
   const auto version = database.integer("PRAGMA user_version");
   if (!version) return database.status();
-  if (*version == kSpoolSchemaVersion) return {};
+  // Another client may have turned the write-ahead log off. For a spool that has one this does
+  // nothing.
+  if (*version == kSpoolSchemaVersion) {
+    SqliteStatus status = database.execute("PRAGMA journal_mode=WAL");
+    return status.ok() ? checkShape(database) : status;
+  }
   if (*version > kSpoolSchemaVersion || *version < 0) {
     return {SQLITE_SCHEMA, "made by another version (schema " + std::to_string(*version) + ")"};
   }
