@@ -39,6 +39,8 @@ class Names(StateTest):
             os.mkfifo(self.state(name + ".new"))
         status = self.machine.result(self.machine.start("tesselctl", "status"), timeout=20)
         self.assertEqual(status.status, 0, status.errors)
+        told = json.loads(self.machine.ctl("status", "--json").out)["refused_files"]
+        self.assertEqual([text.split(": ", 1)[1] for text in told], ["it is no regular file"] * 3)
         self.assertEqual(re.sub(r"\s+", " ", status.out).count(": it is no regular file"), 3, status.out)
         result = self.assert_clean(self.machine.result(self.machine.start(), timeout=20))
         for name in names:

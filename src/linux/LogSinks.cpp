@@ -41,6 +41,7 @@ constexpr struct {
     {"The run marker could not be removed", "283b182eed6347249d31744128c97432"},
     {"The spool refused rows of the run: ", "3d540be105e34511a8b7c59030803b88"},
     {"The books of the run do not balance: ", "2180da59c80c4f7fba8a7a4b47b8ae27"},
+    {"Rows of the spool expired: ", "383c13e7c86348e6b4d033047c7aba86"},
     {"A damaged spool was set aside: ", "2f24059a99aa469594a71fc37ad366be"},
     {"Files of the trace store were not read: ", "e51135e212e748588088feaa13b643c7"},
     {"The trace store is damaged: ", "06d3ff7cb7194f92b1f79ebf73be148c"},

@@ -91,6 +91,11 @@ void addRows(std::vector<RunWarning>& warnings, const RunRecord& record) {
              " rows stored and " + std::to_string(refused) + " refused, of " +
              std::to_string(record.rowsExpected())});
   }
+  if (record.rowsExpired != 0) {
+    warnings.push_back(
+        {"rows_expired", "Rows of the spool expired: " + std::to_string(record.rowsExpired) +
+                             " stood there for longer than TESSEL_SPOOL_DAYS"});
+  }
   if (!record.setAside.empty())
     warnings.push_back(
         {"spool_damaged", "A damaged spool was set aside: " + joined(record.setAside)});

@@ -25,6 +25,7 @@ RunRecord worstRun() {
   RunRecord record;
   record.outcome = RunOutcome::interrupted;
   record.marker = "still there";
+  record.rowsExpired = 7;
   for (int reason = 0; reason < 300; ++reason)
     record.rowsFailed.emplace_back("reason\n" + std::to_string(reason) + std::string(4096, '\x1b'),
                                    1);
@@ -58,10 +59,10 @@ TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
   EXPECT_EQ(runWarnings(record)[0].text,
             "The run was cut short: the last 2 minutes of its day were not read");
   codes.erase(std::unique(codes.begin(), codes.end()), codes.end());
-  EXPECT_THAT(codes, ::testing::ElementsAre("run_cut_short", "marker_stuck", "rows_refused",
-                                            "books_unbalanced", "spool_damaged", "store_unreadable",
-                                            "store_damaged", "dropped_by_daemon",
-                                            "numbers_in_no_file", "malformed", "over_share"));
+  EXPECT_THAT(codes, ::testing::ElementsAre(
+                         "run_cut_short", "marker_stuck", "rows_refused", "books_unbalanced",
+                         "rows_expired", "spool_damaged", "store_unreadable", "store_damaged",
+                         "dropped_by_daemon", "numbers_in_no_file", "malformed", "over_share"));
   auto warnings = runWarnings(record);
   for (const RunOutcome outcome : {RunOutcome::failed, RunOutcome::bailedOut}) {
     record.outcome = outcome;
