@@ -29,17 +29,30 @@ class Writer {
   static constexpr unsigned kServices = 40;
 
   void writeEntry(FILE* out, uint64_t index);
+  void writeOfMany(FILE* out, uint64_t index);
   void writePoint(FILE* out, uint64_t index, unsigned service);
   void writeLine(FILE* out, uint64_t index, unsigned service);
   unsigned below(unsigned limit) { return static_cast<unsigned>(random_() % limit); }
 
   const JournalSpec& spec_;
   std::mt19937 random_{42};
+  uint64_t begins_ = 0;
+  uint64_t ends_ = 0;
 };
 
 void Writer::writeEntry(FILE* out, uint64_t index) {
   const uint64_t offset = kDayMicroseconds / spec_.entries * index;
   const unsigned service = below(kServices);
+  if (spec_.fewFields) {
+    std::fprintf(out,
+                 "__REALTIME_TIMESTAMP=%" PRIu64 "\n__MONOTONIC_TIMESTAMP=%" PRIu64
+                 "\n_BOOT_ID=6c1f5a0e8d3b4f27a9e0c4d1b2f3a495\n_PID=%u\n_UID=1000\n"
+                 "_EXE=/usr/lib/vantor/service%u\n",
+                 kFirstMicrosecond + offset, 1'000'000 + offset, 1000 + service * 7, service);
+    writeOfMany(out, index);
+    std::fputs("\n", out);
+    return;
+  }
   std::fprintf(out,
                "__REALTIME_TIMESTAMP=%" PRIu64 "\n__MONOTONIC_TIMESTAMP=%" PRIu64
                "\n_BOOT_ID=6c1f5a0e8d3b4f27a9e0c4d1b2f3a495\n"
@@ -49,7 +62,9 @@ void Writer::writeEntry(FILE* out, uint64_t index) {
                "_SYSTEMD_CGROUP=/user.slice/vantor-service%u\n",
                kFirstMicrosecond + offset, 1'000'000 + offset, 1000 + service * 7, service, service,
                service, service);
-  if (index % spec_.onePointIn == 0) {
+  if (spec_.openIntervals != 0) {
+    writeOfMany(out, index);
+  } else if (index % spec_.onePointIn == 0) {
     writePoint(out, index, service);
   } else {
     writeLine(out, index, service);
@@ -73,6 +88,30 @@ void Writer::writePoint(FILE* out, uint64_t index, unsigned service) {
   else
     std::fprintf(out, "TESSEL_NUMBER1_NAME=count\nTESSEL_NUMBER1_VALUE=%u\n", below(1000));
   (void)service;
+}
+
+// Of eight entries two are lines, three events, and three begins or ends. While fewer than
+// `openIntervals` are open, there are only begins.
+void Writer::writeOfMany(FILE* out, uint64_t index) {
+  if (!spec_.fewFields)
+    std::fputs("SYSLOG_FACILITY=3\nCODE_FILE=src/main.c\nCODE_FUNC=run\nTHREAD=main\n", out);
+  if (index % 4 == 0) {
+    std::fprintf(out, "PRIORITY=6\nMESSAGE=handled request %" PRIu64 "\n", index);
+    return;
+  }
+  const uint64_t point = index - index / 4;
+  const bool event = point % 2 == 0;
+  const bool end = !event && begins_ - ends_ >= spec_.openIntervals;
+  const uint64_t id = event ? point : end ? ends_++ : begins_++;
+  std::fprintf(out,
+               "TESSEL_KIND=%s\nTESSEL_SUBSYSTEM=com.vantor.Service%" PRIu64
+               "\nTESSEL_CATEGORY=Category%" PRIu64 "\nTESSEL_NAME=Operation\nTESSEL_TELEMETRY=1\n",
+               event ? "event"
+               : end ? "end"
+                     : "begin",
+               id % 20, id % 7);
+  if (!event)
+    std::fprintf(out, "TESSEL_INTERVAL_SCOPE=system\nTESSEL_INTERVAL_ID=%" PRIu64 "\n", id);
 }
 
 void Writer::writeLine(FILE* out, uint64_t index, unsigned service) {

@@ -48,6 +48,8 @@ const std::vector<Case>& cases() {
       {{"dense-1M-200files", 1'000'000, 200, 2}, false},
       {{"sparse-1M-200files", 1'000'000, 200, 20}, false},
       {{"dense-5M-20files", 5'000'000, 20, 2}, false},
+      {{"intervals-400k-9fields", 400'000, 1, 1, 25'000, true}, false},
+      {{"intervals-400k-21fields", 400'000, 1, 1, 25'000, false}, false},
   };
   return all;
 }

@@ -6,13 +6,15 @@
 //
 // Prints the figures of our reader, then a line for each file with a problem, then a line for each
 // reader that differs from ours. The exit status is 1 if one differs. --ours reads with our reader
-// alone. --stop-after stops the reading after that time and prints how long the stop took.
+// alone, and with the PATH "machine" the journal of this machine. --stop-after stops the reading
+// after that time and prints how long the stop took.
 
 #include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <iostream>
+#include <optional>
 #include <set>
 #include <string_view>
 #include <thread>
@@ -88,7 +90,8 @@ std::vector<PlainEntry> readMarked(const std::string& path, const std::vector<Pl
 int compare(const std::string& path, bool withOthers) {
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
-  auto opened = JournalStore::open(path, {}, tokenizer, stop);
+  const auto place = path == "machine" ? std::nullopt : std::optional(path);
+  auto opened = JournalStore::open(place, {}, tokenizer, stop);
   if (const auto* error = std::get_if<PlatformError>(&opened)) {
     std::cout << error->words << "\n";
     return 2;

@@ -196,6 +196,14 @@ class Live(ReadingTest):
         self.assertTrue(any(name.endswith(".journal~") for name in os.listdir(os.path.join(LIVE, os.listdir(LIVE)[0]))))
         self.assertGreaterEqual(self.assert_all_agree(LIVE)["entries"], 660)
 
+    def test_every_namespace_of_the_machine_is_read(self):
+        before = read("machine", "--ours").figures["entries"]
+        folder = os.path.join(LIVE, os.listdir(LIVE)[0] + ".web")
+        os.mkdir(folder)
+        self.addCleanup(shutil.rmtree, folder)
+        shutil.move(self.make("a.journal", exported(70)), os.path.join(folder, "system.journal"))
+        self.assertGreaterEqual(read("machine", "--ours").figures["entries"], before + 70)
+
     def test_a_rotation_neither_loses_nor_doubles_entries(self):
         sent = [0]
 
