@@ -10,9 +10,9 @@
 // moves to `forwarder_set_aside`, together with the collector's words. It stays there until
 // somebody puts it back (requeue) or newer refused rows push it out.
 //
-// Our commits do not flush the disk (synchronous=NORMAL); those of the service do. A power cut may
-// undo an acknowledgement. The row is then delivered again, which delivery at least once allows. A
-// flush here would make the service wait, because its sends need the lock that we hold meanwhile.
+// Our commits do not flush the disk (synchronous=NORMAL). A power cut may undo an acknowledgement.
+// The row is then delivered again, which delivery at least once allows. So a flush for each commit
+// would buy nothing.
 
 #include "statora/ForwarderState.h"
 
@@ -29,12 +29,12 @@ namespace tessel {
 
 namespace {
 
-// The service gives a row up after 250 ms of waiting for the lock. The forwarder loses nothing by
-// waiting, so it waits longer.
+// The service waits for the lock for two seconds at the end of a run, and then gives its rows up.
+// The forwarder loses nothing by waiting, so it waits longer.
 constexpr int kForwardersPatience = 5000;  // milliseconds
 
-// Rows that one transaction removes. A send of the service may come at any moment and wait for the
-// lock. A full batch of 512 rows would hold it four times as long.
+// Rows that one transaction removes. The service may wait for the lock at any moment. A full batch
+// of 512 rows would hold it four times as long.
 constexpr size_t kRowsRemovedAtOnce = 128;
 
 // A newer service may only have added to the spool. It then says in `compatible_from` the oldest
@@ -120,8 +120,8 @@ SqliteStatus ForwarderState::open() {
 
 SqliteStatus ForwarderState::openAndPrepare() {
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
-  // Acknowledgements make the log grow. The service empties it at 1000 pages, in the middle of a
-  // send. The forwarder does so at half that length, to spare the service the work.
+  // Acknowledgements make the log grow. The service empties it at 4000 pages, in the middle of a
+  // run. The forwarder does so much earlier, to spare the service the work.
   if (status.ok())
     status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
   if (status.ok() &&

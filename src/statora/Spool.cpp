@@ -8,7 +8,8 @@
 //
 // The price: a row in the buffer is lost if the process is killed or interrupted, and what became
 // of a send is known only at the end of the run. On a disk that keeps up, a row is in the buffer
-// for about a millisecond.
+// for about a millisecond. A timer lives as long as the process, so a process that stays wakes up
+// once a second, finds nothing to flush, and sleeps again.
 //
 // What was discarded. A transaction and a flush for each send tie the run to the slowest disk. A
 // buffer without bound ends in a kill for memory. A file of our own between buffer and database
