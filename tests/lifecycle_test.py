@@ -186,12 +186,13 @@ class Threads(MachineTest):
 
 
 def runs_of(machine):
-    """How many runs are over. Reads only: this user is another than that of the service."""
+    """How many runs began, by the last one's hurried clock: each is two seconds after the one before it. The spool knows
+    too, but SQLite as root may make a file that the service cannot open for a moment."""
     try:
-        with contextlib.closing(sqlite3.connect(f"file:{machine.state}/statora.db?mode=ro", uri=True)) as database:
-            return database.execute("SELECT count(*) FROM events WHERE name = ?", (STATISTICS,)).fetchone()[0]
-    except sqlite3.OperationalError:
-        return 0  # not made yet, or just being written
+        with open(os.path.join(machine.state, "scheduler-last-run"), encoding="utf-8") as file:
+            return (int(file.read()) / 1e6 - time.time()) / 2
+    except FileNotFoundError:
+        return 0
 
 
 class TwoProcesses(MachineTest):
