@@ -89,7 +89,7 @@ class Limits(StateTest):
 
 
     def test_a_limit_on_file_size_costs_rows_and_no_run(self):
-        self.machine.write_export(some_points(60))
+        self.machine.write_export([point("event", "com.vantor.Calendar", "View", f"{i}" + 2000 * "x") for i in range(60)])
         result = self.run_under("prlimit", "--fsize=65536")
         self.assertEqual(result.returncode, 0, result.stderr)
         record = self.record()
