@@ -116,6 +116,18 @@ class Flood(MachineTest):
         self.assertEqual((lost["uid"], lost["count"]), (HOSTILE, 2000 - names.count("ts__com.vantor.Flood__View__N")))
         self.assertAlmostEqual(lost["count"], 2000 - 24 * 9 / 16 / 0.025, delta=20)
 
+    def test_text_for_the_spool_runs_out(self):
+        long = [chr(1) * 4000 + str(i) for i in range(200)]  # six bytes of JSON for each character
+        junk = (point("event", "com.vantor.Flood", "View", "N", string1=("a", value), at=-3600 + i * 0.001, uid=HOSTILE)
+                for i, value in enumerate(long))
+        self.machine.set_internal(True)
+        log = self.run_flood(itertools.chain(junk, honest("event", -10, "View")), TESSEL_SPOOL_LIMIT=str(16 << 20))
+        names = [name for name, _ in self.machine.rows()]
+        self.assertEqual(names.count("ts__com.vantor.Honest__View__N"), 50)
+        self.assertEqual(names.count("com.vantor.performance.tessel"), names.count("ts__com.vantor.Flood__View__N") + 50)
+        self.assertLess(len(names), 2 * 50 + 2 * 50)
+        self.assertTrue(any("beyond_text_limit: too much text for one run (user 1000, /opt/" in line for line in log))
+
     def test_every_value_is_new_and_as_long_as_may_be(self):
         count = POINTS // 10
 

@@ -33,6 +33,9 @@ class EventSender {
   // was taken may still be lost later; the sender keeps account of that. Called on the reporting
   // queue only.
   virtual bool sendEvent(std::string_view name, const Payload& payload, EventRank rank) = 0;
+  // Bytes that an event whose name and payload have so many bytes takes of what a run may send. Any
+  // thread.
+  virtual uint64_t spaceOf(size_t textBytes) const { return textBytes; }
 };
 
 // A value of a configuration: null, a number, a string, a list or a dictionary.

@@ -38,7 +38,7 @@ class EventRoad {
   EventRoad(Throttle& throttle, EventSender& sender, SerialQueue& reportingQueue)
       : throttle_(throttle), sender_(sender), reportingQueue_(reportingQueue) {}
 
-  // Bytes of all rows queued so far, names included.
+  // Bytes that all rows queued so far take of what a run may send.
   uint64_t queuedBytes() const { return queuedBytes_; }
 
   // Queues two events with the same payload. The first has the name that all objects share. The

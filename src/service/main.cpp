@@ -36,9 +36,6 @@ T& keep(Args&&... args) {
   return *kept.emplace_back(new T(std::forward<Args>(args)...));
 }
 
-// What one run may send, so that a flood of one day leaves room for a week.
-constexpr uint64_t kRunsInASpool = 8;
-
 [[noreturn]] void refuse(int status, const std::string& line) {
   std::fprintf(stderr, "tessel_reporter: %s\n", line.c_str());
   std::exit(status);
@@ -93,6 +90,10 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
   }
 }
 
+SpoolLimits spoolLimits(const LaunchConfiguration& launch) {
+  return {launch.spoolLimitBytes, launch.spoolDays};
+}
+
 // Makes the parts that take an object from the store to the spool.
 TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& variant, Spool& spool,
                           QueueFactory& queues, SerialQueue& reportingQueue, Clock& clock,
@@ -103,7 +104,7 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
   auto& identity = keep<ProcessIdentity>(keep<AppBundles>(volumes));
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   ExtractionLimits limits;
-  limits.shares.rowBytes = launch.spoolLimitBytes / kRunsInASpool;
+  limits.shares.rowBytes = spoolLimits(launch).ofARun();
   if (launch.runLimit.count() != 0)
     limits.shares.nanoseconds =
         static_cast<uint64_t>(std::chrono::nanoseconds(launch.runLimit).count());
@@ -134,8 +135,7 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& gate = keep<TaskingGate>(variant, configurations, queues, clock);
   const auto writerQueue =
       std::make_shared<WorkerQueue>("tessel_reporter spool writer queue", QueueThread::own);
-  const SpoolLimits limits{launch.spoolLimitBytes, launch.spoolDays};
-  auto& spool = keep<Spool>(state.path(), limits, clock, status, writerQueue, queues);
+  auto& spool = keep<Spool>(state.path(), spoolLimits(launch), clock, status, writerQueue, queues);
   auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
                             [&spool, &state, &reportingQueue](const RunRecord& record) {

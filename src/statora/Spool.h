@@ -52,6 +52,7 @@ class Spool final : public EventSender {
         std::shared_ptr<SerialQueue> writer, QueueFactory& timers);
 
   bool sendEvent(std::string_view name, const Payload& payload, EventRank rank) override;
+  uint64_t spaceOf(size_t textBytes) const override { return spaceOfRow(textBytes); }
 
   // Ends a run. Waits until each row is stored or has failed, removes rows that have stood there
   // too long, flushes and closes the database. Answers the figures of the run; those of the next

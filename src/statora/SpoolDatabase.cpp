@@ -51,9 +51,6 @@ constexpr int64_t kCheckpointPages = 4000;
 constexpr int64_t kLeastCheckpointPages = 16;
 constexpr int64_t kLogShare = 32;
 
-// One run may take an eighth of the limit. So a flood of one day leaves room for a week.
-constexpr uint64_t kRunShare = 8;
-
 // The patience of one insert. The rows wait in memory and are tried again each second, so a long
 // wait would win nothing.
 constexpr std::chrono::milliseconds kPatience{250};
@@ -65,14 +62,6 @@ constexpr int kPagesVacuumedAtOnce = 256;
 // Rows stand in the order of sending. Where the clock was set, old rows may stand behind newer
 // ones, so the search goes on for so many rows. To read the whole spool would take seconds.
 constexpr size_t kNewerRowsLookedAt = 16384;
-
-// Bytes of pages that such rows take one after another. A page holds as many short rows as fit; a
-// long row has pages of its own.
-uint64_t spaceOf(size_t textBytes) {
-  const uint64_t bytes = textBytes + kBytesBesideText;
-  if (bytes <= kRowBytesInPage) return kPageBytes / (kRowBytesInPage / bytes);
-  return (bytes / kRowBytesInOverflowPage + 1) * kPageBytes;
-}
 
 // Pages that a row must leave free, for those of a higher rank. The events of the counts are at
 // most 30 a run, and their text seldom fills a page; a row of statistics is shorter than a page.
@@ -91,6 +80,12 @@ int64_t valueOf(SqliteStatement& statement) {
 }
 
 }  // namespace
+
+uint64_t spaceOfRow(size_t textBytes) {
+  const uint64_t bytes = textBytes + kBytesBesideText;
+  if (bytes <= kRowBytesInPage) return kPageBytes / (kRowBytesInPage / bytes);
+  return (bytes / kRowBytesInOverflowPage + 1) * kPageBytes;
+}
 
 SpoolDatabase::SpoolDatabase(std::string stateDirectory, SpoolLimits limits)
     : directory_(std::move(stateDirectory)),
@@ -188,7 +183,7 @@ SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
     if (row.refused) continue;
     insert_.bind(1, row.time).bind(2, row.name).bind(3, *row.payload);
     if (!insert_.run()) return database_.status();
-    takenByRun_ += spaceOf(row.textBytes());
+    takenByRun_ += spaceOfRow(row.textBytes());
   }
   return {};
 }
@@ -197,9 +192,9 @@ SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
 // although its pages will also go into the database, so both are counted. Twice the usual log is
 // never given to rows: the log needs it between two checkpoints.
 std::optional<SpoolFailure> SpoolDatabase::refusal(const PendingRow& row) {
-  const uint64_t space = spaceOf(row.textBytes());
+  const uint64_t space = spaceOfRow(row.textBytes());
   const int64_t kept = pagesKeptFrom(row.rank, maxPages_);
-  const uint64_t share = limits_.bytes / kRunShare;
+  const uint64_t share = limits_.ofARun();
   if (row.rank != EventRank::statistics &&
       takenByRun_ + space + static_cast<uint64_t>(kept * kPageBytes) > share) {
     return SpoolFailure::runShare;

@@ -24,7 +24,14 @@ namespace tessel {
 struct SpoolLimits {
   uint64_t bytes = uint64_t{1} << 30;  // of the database and its write-ahead log together
   std::chrono::days days{30};          // how long a row may stay; zero: for ever
+
+  // What one run may take: an eighth. So a flood of one day leaves room for a week.
+  uint64_t ofARun() const { return bytes / 8; }
 };
+
+// Bytes of pages that rows of this length take one after another. A page holds as many short rows
+// as fit; a long row has pages of its own.
+uint64_t spaceOfRow(size_t textBytes);
 
 // A row on its way into the spool. The two events of an object share one payload.
 struct PendingRow {
