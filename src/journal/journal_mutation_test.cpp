@@ -28,7 +28,7 @@ using testing::JournalWriter;
 using testing::put;
 
 // The first and the last entry are no trace points: nothing tells whether their boot is right.
-constexpr size_t kEntries = 121;
+constexpr size_t kJournalEntries = 121;
 
 uint64_t wordAt(const std::string& file, uint64_t at) {
   return load<uint64_t>(reinterpret_cast<const uint8_t*>(file.data()) + at);
@@ -37,7 +37,7 @@ uint64_t wordAt(const std::string& file, uint64_t at) {
 // Every third entry is a trace point, every fifteenth tells of loss.
 JournalWriter journalWith(JournalLayout layout) {
   JournalWriter writer(layout);
-  for (size_t i = 1; i <= kEntries; ++i) {
+  for (size_t i = 1; i <= kJournalEntries; ++i) {
     EntryHeader header;
     header.bootId = {1};
     header.monotonic = i * 1000;
@@ -186,8 +186,8 @@ TEST_P(JournalMutationTest, ChangesNothingWithoutAWord) {
   const std::string good = journalWith(layout).bytes();
   const std::string path = directory.write("a.journal", good);
   const Points truth = pointsIn(path, {"TESSEL_"});
-  ASSERT_EQ(truth.texts.size(), kEntries / 3);
-  ASSERT_EQ(truth.dropped, kEntries / 15 + 1);
+  ASSERT_EQ(truth.texts.size(), kJournalEntries / 3);
+  ASSERT_EQ(truth.dropped, kJournalEntries / 15 + 1);
   ASSERT_FALSE(truth.told);
   const Bender bender(good, compact);
   std::mt19937_64 random(1);
