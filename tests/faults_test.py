@@ -5,10 +5,12 @@ There are many places where a call can fail; by default the tests take a sample.
 every place. TESSEL_RANDOM_KILLS is the number of random moments at which the process is killed.
 """
 import concurrent.futures
+import contextlib
 import errno
 import os
 import random
 import shutil
+import sqlite3
 import subprocess
 import time
 import unittest
@@ -108,6 +110,26 @@ class Disk(FaultTest):
         each(some_points(2), cases, self.check_spool)
         self.assertIn((errno.ENOSPC, "disk_full"), self.reasons)
         self.assertNotIn((errno.ENOSPC, "limit"), self.reasons)
+
+    def test_a_checkpoint_that_fails_costs_its_rows_alone(self):
+        """With the small limit each few transactions end with a checkpoint; a client's long log makes one at once."""
+        machine = self.machine(some_points(60))
+        for environment, log_rows, lost in (({"TESSEL_SPOOL_LIMIT": str(4 << 20)}, 0, 3), ({}, 60, 1)):
+            machine.forget_state()
+            self.assert_clean(machine.run())
+            with contextlib.closing(sqlite3.connect(os.path.join(machine.state, "statora.db"))) as client:
+                client.execute("PRAGMA wal_autocheckpoint=0")
+                for _ in range(log_rows):
+                    client.execute("INSERT INTO events(time, name, payload) VALUES(?, 'x', ?)",
+                                   (int(time.time() * 1e6), "y" * 300000))
+                    client.commit()
+                result = self.assert_clean(machine.run_faulty(environment, PATH="statora.db-wal", CALL="fdatasync",
+                                                              AT=1, TIMES=lost))
+            self.assertIn("Cleared cookie file", result.log)
+            record = machine.record()
+            self.assertGreater(record["rows_failed"]["other"], 0, "the flush failed at a checkpoint")
+            self.assertEqual(record["rows_stored"] + sum(record["rows_failed"].values()), len(machine.expected))
+            self.assertFalse(machine.marker_exists())
 
     def test_the_other_files_of_the_state_may_fail_too(self):
         def check(machine, case):

@@ -42,6 +42,7 @@ constexpr size_t kRowsOfTransaction = 64;
 constexpr size_t kBytesOfTransaction = size_t{256} << 10;
 
 constexpr std::chrono::seconds kFlushInterval{1};
+constexpr std::string_view kCheckpointFailed = "a checkpoint could not be flushed";
 
 // The end of a run waits so long for another client's lock. The forwarder holds its locks for a
 // small part of that.
@@ -211,6 +212,7 @@ bool Spool::Writer::insertBatch() {
   if (status.ok()) {
     for (const PendingRow& row : batch_) settle(row);
     batch_.clear();
+    countRowsAtRisk(kCheckpointFailed);
     return true;
   }
   // One row may fail where the others do not, so each gets a transaction of its own.
@@ -219,6 +221,7 @@ bool Spool::Writer::insertBatch() {
     if (isLocked(status)) return false;
     if (status.ok()) {
       settle(batch_.front());
+      countRowsAtRisk(kCheckpointFailed);
     } else {
       fail(batch_.front(), classify(status), status.reason);
     }
@@ -237,7 +240,6 @@ SqliteStatus Spool::Writer::insert(std::span<PendingRow> rows) {
       status = database_.insert(rows);
     }
   }
-  countRowsAtRisk("a checkpoint could not be flushed");
   if (needsReopening(status)) {
     flush();
     database_.close();
@@ -280,7 +282,8 @@ void Spool::Writer::flush() {
 void Spool::Writer::countRowsAtRisk(std::string_view reason) {
   const uint64_t rows = database_.takeRowsAtRisk();
   if (rows == 0) return;
-  // They were counted as stored when they were inserted.
+  // They were counted as stored when they were inserted. The rows of a transaction may be among
+  // them if its own checkpoint failed, so the caller has settled these first.
   TESSEL_INVARIANT(figures_.stored >= rows);
   figures_.stored -= rows;
   count(SpoolFailure::other, rows, reason);
