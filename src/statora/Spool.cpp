@@ -48,6 +48,10 @@ constexpr std::string_view kCheckpointFailed = "a checkpoint could not be flushe
 // small part of that.
 constexpr std::chrono::seconds kLastPatience{2};
 
+uint64_t ticksOf(std::chrono::nanoseconds time, Timebase base) {
+  return static_cast<uint64_t>(time.count()) * base.denominator / base.numerator;
+}
+
 bool isLocked(const SqliteStatus& status) {
   return status.primaryCode() == SQLITE_BUSY || status.primaryCode() == SQLITE_LOCKED;
 }
@@ -109,7 +113,9 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
       : database_(std::move(stateDirectory), limits),
         clock_(clock),
         status_(status),
-        queue_(std::move(queue)) {}
+        queue_(std::move(queue)),
+        flushTicks_(ticksOf(kFlushInterval, clock.timebase())),
+        flushedAt_(clock.continuousTicks()) {}
 
   // On the reporting queue.
   bool take(PendingRow row);
@@ -136,6 +142,7 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
   Clock& clock_;
   ServiceStatus& status_;
   const std::shared_ptr<SerialQueue> queue_;
+  const uint64_t flushTicks_;  // ticks of the clock between two flushes
 
   std::mutex mutex_;  // for the members up to the blank line
   std::deque<PendingRow> buffer_;
@@ -145,6 +152,7 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
   uint64_t bufferFull_ = 0;
 
   std::vector<PendingRow> batch_;  // rows of the buffer that are being inserted
+  uint64_t flushedAt_ = 0;         // in ticks of the clock
   SpoolFigures figures_;
   SpoolFailures unsaved_{};  // failures that the totals in the database lack
 };
@@ -181,10 +189,14 @@ void Spool::Writer::insertNew() {
 }
 
 // Inserts what waits. False if another client has the database locked; the rest then waits for the
-// next tick.
+// next tick. While rows come as fast as they are inserted, the loop does not end and no tick gets
+// its turn. So the loop flushes, too.
 bool Spool::Writer::insertAll() {
   while (takeBatch()) {
-    if (insertBatch()) continue;
+    if (insertBatch()) {
+      if (clock_.continuousTicks() - flushedAt_ >= flushTicks_) flush();
+      continue;
+    }
     const std::lock_guard lock(mutex_);
     awaited_ = true;
     return false;
@@ -276,6 +288,7 @@ void Spool::Writer::count(SpoolFailure failure, uint64_t rows, std::string_view 
 
 void Spool::Writer::flush() {
   const SqliteStatus status = database_.flush();
+  flushedAt_ = clock_.continuousTicks();
   countRowsAtRisk(status.reason);
 }
 
