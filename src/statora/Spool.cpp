@@ -148,6 +148,7 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
   std::deque<PendingRow> buffer_;
   size_t bufferedBytes_ = 0;  // of the buffer and of the batch
   bool awaited_ = false;      // insertNew() is queued, or the rows wait for tick()
+  bool gathering_ = false;    // they wait until they fill a transaction, if that is sooner
   uint64_t sent_ = 0;
   uint64_t bufferFull_ = 0;
 
@@ -172,7 +173,9 @@ bool Spool::Writer::take(PendingRow row) {
   if (!buffer_.empty() && *buffer_.back().payload == *row.payload)
     row.payload = buffer_.back().payload;
   buffer_.push_back(std::move(row));
-  if (!std::exchange(awaited_, true))
+  const bool gathered = gathering_ && bufferedBytes_ >= kBytesOfTransaction;
+  if (gathered) gathering_ = false;
+  if (!std::exchange(awaited_, true) || gathered)
     queue_->async([self = shared_from_this()] { self->insertNew(); });
   return true;
 }
@@ -182,7 +185,8 @@ void Spool::Writer::insertNew() {
     const std::lock_guard lock(mutex_);
     // Each transaction makes a log that is held longer by a few pages, so there are fewer. Rows
     // that fill a transaction would gain nothing by waiting.
-    if (database_.logIsHeld() && bufferedBytes_ < kBytesOfTransaction) return;
+    gathering_ = database_.logIsHeld() && bufferedBytes_ < kBytesOfTransaction;
+    if (gathering_) return;
     awaited_ = false;
   }
   insertAll();

@@ -335,6 +335,10 @@ TEST_F(SpoolTest, AReaderThatStaysCostsRowsOnlyAtTheLimit) {
   ASSERT_TRUE(other.database().execute("BEGIN; SELECT count(*) FROM events").ok());
   EXPECT_EQ(flood().stored, 90u * 9 + 1);
   EXPECT_GT(sizeOf("statora.db-wal"), kSmall.bytes / 16);
+  for (int i = 0; i < 2; ++i) spool.send("a", numbered(i));
+  EXPECT_EQ(Reader(directory_.path()).count(), 90 * 9 + 1) << "they wait for others";
+  for (int i = 0; i < 3; ++i) spool.send("a", ofSize(100'000));
+  EXPECT_EQ(Reader(directory_.path()).count(), 90 * 9 + 6) << "together they fill a transaction";
   uint64_t held = 0;
   for (int run = 0; run < 20 && held == 0; ++run)
     held = failures(flood(), SpoolFailure::heldByReader);
