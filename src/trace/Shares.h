@@ -1,8 +1,8 @@
 // Shares: divides among the writers what a run has only once: pairs, executables, the text that
 // goes to the spool, and time.
 //
-// What is given away cannot be taken back, so something is kept for those who come late. The last
-// quarter of each total goes only to users who hold less than a sixteenth of the total. Among the
+// What is given away cannot be taken back, so the last quarter of each total is kept for those who
+// come late: it goes only to users who hold less than a sixteenth of the total. Among the
 // programs of one user the same rule holds once more: of the three quarters that are open to every
 // user, the last quarter goes only to programs that hold less than a sixteenth of them. So a
 // program that takes what it can leaves seven sixteenths of the total to others: three to the other

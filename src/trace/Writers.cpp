@@ -12,7 +12,7 @@ namespace tessel {
 
 namespace {
 
-// The record of a run shortens a place to as much.
+// The record of a run shortens a place to this length.
 constexpr size_t kMaxNameBytes = 256;
 
 // In the order of the codes, from openIntervalDropped on.
