@@ -266,30 +266,40 @@ bool ActivityDeliveries::deliverRun() {
                                                    criteria_.runLimit, machineMayDefer());
   handler_(delivery);
   if (const std::optional<DeferReason> reason = delivery->end()) {
+    const std::chrono::nanoseconds wait = planWait(*reason);
     // Give the lock back before the wait, so that another process can run meanwhile.
     turn.reset();
-    putOff(*reason);
+    putOff(*reason, wait);
     return true;
   }
   record(begin);
   return criteria_.interval.has_value();
 }
 
-void ActivityDeliveries::putOff(DeferReason reason) {
-  status_.say("run deferred: " + conditions_.words(reason));
-  warnOnce(reason);
-  if (!isOfTheMachine(reason)) return waitFor(criteria_.deferRetry);
-  const uint64_t begin = clock_.continuousTicks();
+// How long to wait until a deferred run is offered again. The process may end while it waits, for
+// example when the machine is switched off. So a wait that the machine asked for is recorded before
+// it begins, as if it had passed. Otherwise a machine that is never on for a whole wait would never
+// report. The price is that a wait which was cut off counts in full.
+std::chrono::nanoseconds ActivityDeliveries::planWait(DeferReason reason) const {
+  if (!isOfTheMachine(reason)) return criteria_.deferRetry;
   // The last wait is cut, so that the run begins when the limit is reached and not a retry later.
-  waitFor(std::min<std::chrono::nanoseconds>(criteria_.deferRetry,
-                                             criteria_.deferLimit - putOffByMachine_));
-  putOffByMachine_ += timeSince(begin, clock_);
+  const std::chrono::nanoseconds wait = std::min<std::chrono::nanoseconds>(
+      criteria_.deferRetry, criteria_.deferLimit - putOffByMachine_);
+  recordPutOff(putOffByMachine_ + wait);
+  return wait;
 }
 
-// The process may end while a run waits, for example when the machine is switched off. Without a
-// record, a machine that is never on for two hours would never report. Only the holder of the lock
-// writes it. If that fails, the next process counts from the last record on.
-void ActivityDeliveries::recordPutOff(std::chrono::nanoseconds time) {
+void ActivityDeliveries::putOff(DeferReason reason, std::chrono::nanoseconds wait) {
+  status_.say("run deferred: " + conditions_.words(reason));
+  warnOnce(reason);
+  const uint64_t begin = clock_.continuousTicks();
+  waitFor(wait);
+  if (isOfTheMachine(reason)) putOffByMachine_ += timeSince(begin, clock_);
+}
+
+// REQUIRES: the caller holds the lock. If this fails, the next process counts from the last record
+// on.
+void ActivityDeliveries::recordPutOff(std::chrono::nanoseconds time) const {
   const auto seconds = std::chrono::ceil<std::chrono::seconds>(time);
   if (state_.putOff() != seconds) state_.recordPutOff(seconds);
 }

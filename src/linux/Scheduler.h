@@ -139,8 +139,9 @@ class ActivityDeliveries {
   std::optional<Date> waitUntilDue();
   std::optional<Date> lastRun() const;
   void record(Date begin);
-  void putOff(DeferReason reason);
-  void recordPutOff(std::chrono::nanoseconds time);
+  std::chrono::nanoseconds planWait(DeferReason reason) const;
+  void putOff(DeferReason reason, std::chrono::nanoseconds wait);
+  void recordPutOff(std::chrono::nanoseconds time) const;
   bool machineMayDefer() const { return putOffByMachine_ < criteria_.deferLimit; }
   void warnOnce(DeferReason reason);
   void waitFor(std::chrono::nanoseconds duration);

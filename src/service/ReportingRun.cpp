@@ -159,8 +159,10 @@ void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity
   RunRecord record = attempt(activity);
   record.start = began;
   record.end = clock_.now();
-  status_.say("idle");
+  // The disk may need minutes for the rows that still wait, so this is no idle process yet.
+  status_.say("storing the last rows");
   runEnded_(record);
+  status_.say("idle");
 }
 
 RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {

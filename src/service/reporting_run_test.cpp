@@ -92,8 +92,9 @@ TEST_F(RunTest, GoesThroughItsStepsInOrder) {
   EXPECT_FALSE(files.items.contains(cookieFilePath));
   EXPECT_TRUE(activity->statesSet.empty());
   EXPECT_EQ(records.at(0).outcome, RunOutcome::completed);
-  EXPECT_THAT(status.said, ElementsAre("waiting for the tasking configuration",
-                                       "reading the trace store", "summarising", "idle"));
+  EXPECT_THAT(status.said,
+              ElementsAre("waiting for the tasking configuration", "reading the trace store",
+                          "summarising", "storing the last rows", "idle"));
 }
 
 TEST_F(RunTest, AnObjectIsTwoEventsAndANamelessOneOne) {
