@@ -126,6 +126,10 @@ RunRecord recordFrom(const Json& json) {
     record.rowsFailed.emplace_back(reason, count.get<uint64_t>());
   record.setAside = json.at("set_aside").get<std::vector<std::string>>();
   record.marker = json.at("marker").get<std::string>();
+  if (json.contains("totals")) {  // not in a record of an older service
+    record.totals.expired = countAt(json.at("totals"), "expired");
+    record.totals.failed = json.at("totals").at("failed").get<std::map<std::string, uint64_t>>();
+  }
   return record;
 }
 
@@ -156,6 +160,12 @@ std::optional<PlatformError> writeRunRecord(const RunRecord& record,
     });
     json.array("set_aside", record.setAside, [&](const std::string& name) { json.value(name); });
     json.member("marker", record.marker);
+    json.object("totals", [&] {
+      json.member("expired", record.totals.expired);
+      json.object("failed", [&] {
+        for (const auto& [reason, count] : record.totals.failed) json.member(reason, count);
+      });
+    });
   });
   return replaceFileDurably(runRecordPath(stateDirectory), text + "\n");
 }

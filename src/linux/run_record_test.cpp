@@ -65,7 +65,9 @@ RunRecord mixedDay() {
   record.countEvents = 7;
   record.rowsStored = 9;
   record.rowsExpired = 12;
-  record.rowsFailed = {{"locked", 1}, {"disk_full", 2}};
+  record.rowsFailed = {{"locked", 1}, {"disk_full", 2}, {"limit", 0}};
+  record.addTotals({5, {{"locked", 7}, {"read_only", 3}}});
+  EXPECT_EQ(record.totals, (RowTotals{17, {{"disk_full", 2}, {"locked", 8}, {"read_only", 3}}}));
   record.setAside = {"statora.db.damaged-20261118T110640Z"};
   record.marker = "removed";
   record.logEvents = 18'446'744'073'709'551'615u;

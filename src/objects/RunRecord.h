@@ -13,6 +13,7 @@
 
 #include <array>
 #include <cstdint>
+#include <map>
 #include <numeric>
 #include <optional>
 #include <string>
@@ -42,6 +43,15 @@ constexpr std::string_view runOutcomeName(RunOutcome outcome) {
   return kRunOutcomeNames[static_cast<size_t>(outcome)];
 }
 
+// Rows that no forwarder will deliver, over all runs since the first one that left a record. They
+// stand in the record and not in the spool: a spool that refuses rows may refuse the count as well.
+struct RowTotals {
+  uint64_t expired = 0;
+  std::map<std::string, uint64_t> failed;  // by reason; none that never occurred
+
+  bool operator==(const RowTotals&) const = default;
+};
+
 struct RunRecord {
   Date start{};
   Date end{};
@@ -61,6 +71,7 @@ struct RunRecord {
   std::vector<std::pair<std::string, uint64_t>> rowsFailed;  // every reason, also those with 0 rows
   std::vector<std::string> setAside;                         // file names of damaged spools
   std::string marker;                                        // "removed" or "still there"
+  RowTotals totals;                                          // this run's rows included
 
   // Whether the run got as far as sending anything.
   bool hasBooks() const {
@@ -77,6 +88,14 @@ struct RunRecord {
     return 2 * (reported() - unsendable) - unnamed + countEvents + 1;
   }
   bool rowsBalance() const { return rowsStored == rowsExpected(); }
+  // Sets the totals from those of the run before.
+  void addTotals(RowTotals before) {
+    totals = std::move(before);
+    totals.expired += rowsExpired;
+    for (const auto& [reason, count] : rowsFailed) {
+      if (count != 0) totals.failed[reason] += count;
+    }
+  }
 
   bool operator==(const RunRecord&) const = default;
 };

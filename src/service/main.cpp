@@ -80,13 +80,20 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
 // when the run has ended, which takes as long as the disk needs.
 void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirectory) {
   const SpoolFigures figures = spool.endRun();
-  if (record.outcome != RunOutcome::notTasked) {
+  const std::optional<RunRecord> last = readRunRecord(stateDirectory);
+  if (record.outcome == RunOutcome::notTasked) {
+    // Such a run leaves no record of its own. But rows may have expired, and those are counted.
+    if (!last || figures.expired == 0) return;
+    record = *last;
+    record.totals.expired += figures.expired;
+  } else {
     addRows(record, figures);
+    record.addTotals(last ? last->totals : RowTotals{});
     record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
-    if (const auto failure = writeRunRecord(record, stateDirectory)) {
-      platformLog().warning("The record of the run is not written: %@", failure->words);
-    }
     logRunWarnings(record);
+  }
+  if (const auto failure = writeRunRecord(record, stateDirectory)) {
+    platformLog().warning("The record of the run is not written: %@", failure->words);
   }
 }
 

@@ -136,7 +136,6 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
   void countRowsAtRisk(std::string_view reason);
   void giveUp();
   void finishRun();
-  void saveTotals();
 
   SpoolDatabase database_;
   Clock& clock_;
@@ -155,7 +154,6 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
   std::vector<PendingRow> batch_;  // rows of the buffer that are being inserted
   uint64_t flushedAt_ = 0;         // in ticks of the clock
   SpoolFigures figures_;
-  SpoolFailures unsaved_{};  // failures that the totals in the database lack
 };
 
 bool Spool::Writer::take(PendingRow row) {
@@ -287,7 +285,6 @@ void Spool::Writer::count(SpoolFailure failure, uint64_t rows, std::string_view 
     tesselReporterLog().debug("Spool %@ does not take events: %@", database_.path(), reason);
   }
   figures_.failed[kind] += rows;
-  unsaved_[kind] += rows;
 }
 
 void Spool::Writer::flush() {
@@ -313,12 +310,7 @@ void Spool::Writer::tick() {
   }
   database_.retryHeldLog();
   insertAll();
-  saveTotals();
   flush();
-}
-
-void Spool::Writer::saveTotals() {
-  if (unsaved_ != SpoolFailures{} && database_.addRefused(unsaved_)) unsaved_ = {};
 }
 
 SpoolFigures Spool::Writer::endRun() {
@@ -341,12 +333,10 @@ void Spool::Writer::finishRun() {
     const std::lock_guard lock(mutex_);
     constexpr auto kKind = static_cast<size_t>(SpoolFailure::bufferFull);
     figures_.sent = std::exchange(sent_, 0);
-    figures_.failed[kKind] = bufferFull_;
-    unsaved_[kKind] += std::exchange(bufferFull_, 0);
+    figures_.failed[kKind] = std::exchange(bufferFull_, 0);
     awaited_ = false;
   }
   figures_.expired = database_.expire(clock_.now(), [this] { status_.progress(); });
-  saveTotals();
   flush();
   database_.close();
   database_.beginRun();

@@ -141,15 +141,13 @@ SqliteStatus SpoolDatabase::open() {
   }
   pageCount_ = database_.prepare("PRAGMA page_count", true);
   freePages_ = database_.prepare("PRAGMA freelist_count", true);
-  total_ = database_.prepare(
-      "INSERT INTO meta VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET value = value + ?2", true);
   insert_ = database_.prepare("INSERT INTO events(time, name, payload) VALUES(?1, ?2, ?3)", true);
-  const bool good = pageCount_.prepared() && freePages_.prepared() && total_.prepared();
+  const bool good = pageCount_.prepared() && freePages_.prepared();
   return good && insert_.prepared() ? SqliteStatus{} : database_.status();
 }
 
 void SpoolDatabase::forgetStatements() {
-  for (SqliteStatement* statement : {&insert_, &pageCount_, &freePages_, &total_}) *statement = {};
+  for (SqliteStatement* statement : {&insert_, &pageCount_, &freePages_}) *statement = {};
 }
 
 void SpoolDatabase::close() {
@@ -319,26 +317,10 @@ std::optional<int64_t> SpoolDatabase::remove(std::span<const int64_t> ids) {
     removed += database_.changes();  // the forwarder may have removed it meanwhile
     return done;
   });
-  good = good && addTotal(kExpiredTotalKey, removed) && database_.execute("COMMIT").ok();
+  good = good && database_.execute("COMMIT").ok();
   if (!good) database_.execute("ROLLBACK");
   if (logPages_ >= nextCheckpoint_) checkpoint();
   return good ? std::optional(removed) : std::nullopt;
-}
-
-bool SpoolDatabase::addTotal(std::string_view key, int64_t count) {
-  return total_.bind(1, key).bind(2, count).run();
-}
-
-bool SpoolDatabase::addRefused(const SpoolFailures& refused) {
-  if (!isOpen() || !database_.execute("BEGIN IMMEDIATE").ok()) return false;
-  bool good = true;
-  for (size_t kind = 0; kind < kSpoolFailureKinds; ++kind) {
-    const std::string key = refusedTotalKey(static_cast<SpoolFailure>(kind));
-    if (refused[kind] != 0) good = good && addTotal(key, static_cast<int64_t>(refused[kind]));
-  }
-  good = good && database_.execute("COMMIT").ok();
-  if (!good) database_.execute("ROLLBACK");
-  return good;
 }
 
 // abandon() and not close(): a checkpoint would write into the damaged file.

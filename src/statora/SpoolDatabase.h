@@ -71,8 +71,6 @@ class SpoolDatabase {
   // Removes the rows of earlier runs that are older than the limit on `now`, and gives free space
   // back to the file system. Answers how many rows were removed. `progress` is called at each step.
   uint64_t expire(Date now, const std::function<void()>& progress);
-  // Adds to the totals in the database. False if that failed, or if the database is not open.
-  bool addRefused(const SpoolFailures& refused);
 
   // Begins the books of the next run.
   void beginRun();
@@ -98,7 +96,6 @@ class SpoolDatabase {
   bool expireNext(Search& search);
   std::optional<int64_t> remove(std::span<const int64_t> ids);
   void giveSpaceBack(const std::function<void()>& progress);
-  bool addTotal(std::string_view key, int64_t count);
   bool mayGrowLog();
   static int afterCommit(void* self, sqlite3* handle, const char* schema, int logPages);
 
@@ -109,7 +106,7 @@ class SpoolDatabase {
   const int64_t checkpointPages_;
 
   SqliteDatabase database_;
-  SqliteStatement insert_, pageCount_, freePages_, total_;
+  SqliteStatement insert_, pageCount_, freePages_;
   std::chrono::milliseconds patience_;
   int64_t firstIdOfRun_ = 0;    // 0 until the run has opened the database
   uint64_t takenByRun_ = 0;     // bytes of pages

@@ -1,4 +1,4 @@
-// The spool as a file: its schema, its totals, and renaming a damaged one.
+// The spool as a file: its schema, and renaming a damaged one.
 
 #include "statora/SpoolFile.h"
 
@@ -154,25 +154,6 @@ const char* spoolFailureName(SpoolFailure failure) {
       "limit",   "disk_full", "read_only",   "locked",    "damaged",
       "version", "other",     "buffer_full", "run_share", "held_by_reader"};
   return kNames[static_cast<size_t>(failure)];
-}
-
-std::string refusedTotalKey(SpoolFailure failure) {
-  return std::string("refused_") + spoolFailureName(failure);
-}
-
-std::optional<SpoolTotals> readSpoolTotals(SqliteDatabase& database) {
-  SqliteStatement select = database.prepare("SELECT key, CAST(value AS INTEGER) FROM meta");
-  if (!select.prepared()) return {};
-  SpoolTotals totals;
-  while (select.step() == SqliteStatement::Step::row) {
-    const std::string_view key = select.text(0);
-    const auto value = static_cast<uint64_t>(select.integer(1));
-    if (key == kExpiredTotalKey) totals.expired = value;
-    for (size_t kind = 0; kind < kSpoolFailureKinds; ++kind) {
-      if (key == refusedTotalKey(static_cast<SpoolFailure>(kind))) totals.refused[kind] = value;
-    }
-  }
-  return totals;
 }
 
 }  // namespace tessel

@@ -3,9 +3,8 @@
 //
 //   events  one row per event, in the order of sending
 //   meta    facts about this spool: `spool_id`, 32 hexadecimal digits, drawn when it was made;
-//           `expired` and `refused_<reason>`, the totals of SpoolTotals; `compatible_from`, if it
-//           is there, is the oldest schema version whose forwarder may still deliver the rows. An
-//           upgrade that only adds writes it.
+//           `compatible_from`, if it is there, is the oldest schema version whose forwarder may
+//           still deliver the rows. An upgrade that only adds writes it.
 //
 // The forwarder keeps tables of its own in the same file.
 
@@ -56,17 +55,5 @@ using SpoolFailures = std::array<uint64_t, kSpoolFailureKinds>;
 // "limit", "disk_full", "read_only", "locked", "damaged", "version", "other", "buffer_full",
 // "run_share", "held_by_reader".
 const char* spoolFailureName(SpoolFailure failure);
-
-// What happened to rows since the spool was made.
-struct SpoolTotals {
-  uint64_t expired = 0;     // removed, because they had stood there too long
-  SpoolFailures refused{};  // never stored
-};
-// Absent if it cannot be read.
-std::optional<SpoolTotals> readSpoolTotals(SqliteDatabase& database);
-
-// The keys of the totals in `meta`. A total of zero may have none.
-inline constexpr char kExpiredTotalKey[] = "expired";
-std::string refusedTotalKey(SpoolFailure failure);
 
 }  // namespace tessel

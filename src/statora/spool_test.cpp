@@ -190,11 +190,6 @@ TEST_F(SpoolTest, RowsWaitForALockUntilTheRunEnds) {
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(20))
       << "few waits a run";
   EXPECT_EQ(log_.lines().size(), 1u);
-  EXPECT_EQ(readSpoolTotals(other.database())->refused[size_t(SpoolFailure::locked)], 0u)
-      << "it was locked";
-  EXPECT_TRUE(spool.send("a", numbered(1)));
-  spool.endRun();
-  EXPECT_EQ(readSpoolTotals(other.database())->refused[size_t(SpoolFailure::locked)], 200u);
 }
 
 TEST_F(SpoolTest, ThreadsLoseNoRow) {
@@ -222,6 +217,7 @@ TEST_F(SpoolTest, ABufferThatIsFullRefusesObjectsAlone) {
   EXPECT_EQ(failures(figures, SpoolFailure::bufferFull), 2u);
   EXPECT_EQ(log_.lines().size(), 1u);
   EXPECT_TRUE(spool.queue("a", large)) << "the buffer is empty again";
+  EXPECT_EQ(spool.endRun().stored, 1u);
 }
 
 TEST_F(SpoolTest, AFailedSendHasItsReason) {
@@ -263,7 +259,6 @@ TEST_F(SpoolTest, AFailedSendHasItsReason) {
     EXPECT_EQ(figures.stored, 1u) << "works again as soon as the cause is gone";
     EXPECT_EQ(log_.lines().size(), 1u);
     EXPECT_TRUE(filesWith("damaged").empty());
-    EXPECT_EQ(readSpoolTotals(Reader(directory_.path()).database())->refused[size_t(c.reason)], 3u);
     std::filesystem::remove_all(file);
   }
 }
@@ -312,7 +307,6 @@ TEST_F(SpoolTest, RowsPastTheirDaysGo) {
   EXPECT_LT(sizeOf(kSpoolFileName), before / 5) << "the space is given back";
   Reader reader(directory_.path());
   EXPECT_EQ(reader.count(), 10);
-  EXPECT_EQ(readSpoolTotals(reader.database())->expired, 71u);
 
   clock_.advance(std::chrono::hours{24 * 1000});
   Bench keeping = bench({.bytes = kSmall.bytes, .days = std::chrono::days{0}});

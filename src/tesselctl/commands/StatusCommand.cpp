@@ -37,6 +37,13 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   json.object("rows_failed", [&] {
     for (const auto& [reason, count] : run.rowsFailed) json.member(reason, count);
   });
+  json.member("rows_expired", run.rowsExpired);
+  json.object("totals", [&] {
+    json.member("expired", run.totals.expired);
+    json.object("failed", [&] {
+      for (const auto& [reason, count] : run.totals.failed) json.member(reason, count);
+    });
+  });
   if (hasBooks) {
     json.member("objects_balance", run.objectsBalance());
     json.member("rows_balance", run.rowsBalance());
@@ -210,6 +217,7 @@ class Screen {
     for (const auto& [reason, count] : run.rowsFailed) {
       if (count != 0) more(grouped(count) + " rows failed: " + reason);
     }
+    if (run.rowsExpired != 0) more(grouped(run.rowsExpired) + " rows of earlier runs expired");
     for (const std::string& name : run.setAside) more("a damaged spool was set aside as " + name);
   }
   void balance(std::string_view what, bool balances, const std::string& words) {
