@@ -45,8 +45,6 @@ FieldToken TracePointTable::malformedToken(FieldKind kind, MalformedReason reaso
   return addOnce(wholeField(FieldKind::malformed, static_cast<uint64_t>(reason) | required));
 }
 
-// Nearly every trace point has all required fields. So the reader follows only the first field's
-// list of entries, and uses the other fields to check that this list is enough.
 // Every field that makes an entry a trace point begins like this, and so do most others of it. So a
 // damaged field hides no trace point.
 std::vector<std::string_view> TracePointTable::marks() const { return {"TESSEL_"}; }
