@@ -70,6 +70,8 @@ class Store(MachineTest):
         self.assertEqual(ctl("record", "begin", *point, *common, "--ago", "100").returncode, 0)
         self.assertEqual(ctl("record", "end", *point, *common, "--ago", "40", "--comm", "other").returncode, 0)
         self.assertEqual(ctl("record", "event", *point, *common, "--ago", "90000").returncode, 0)
+        with open(os.path.join(self.machine.store, "tessel.export"), encoding="utf-8") as file:
+            self.assertEqual(file.read().count(f"\n_UID={os.getuid()}\n"), 3)
         self.run_clean()
         payloads = [dict(payload) for name, payload in self.machine.rows() if name == EVENT]
         self.assertEqual(len(payloads), 1)

@@ -161,9 +161,10 @@ RecordOrigin currentOrigin() {
   std::error_code error;
   const auto image = std::filesystem::read_symlink("/proc/self/exe", error);
   if (!error) origin.imagePath = image.string();
-  // The daemon takes these two from the kernel too, so our entry looks like one of its own.
+  // The daemon takes these three from the kernel too, so our entry looks like one of its own.
   origin.processName = firstLineOf("/proc/self/comm");
   origin.process = std::to_string(::getpid());
+  origin.user = std::to_string(::getuid());
   return origin;
 }
 
@@ -178,6 +179,7 @@ std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
   if (origin.imagePath) appendField(text, "_EXE", *origin.imagePath);
   if (origin.processName) appendField(text, "_COMM", *origin.processName);
   if (origin.process) appendField(text, "_PID", *origin.process);
+  if (origin.user) appendField(text, "_UID", *origin.user);
   return text + '\n';
 }
 

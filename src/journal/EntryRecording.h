@@ -30,6 +30,7 @@ struct RecordOrigin {
   std::optional<std::string> imagePath;
   std::optional<std::string> processName;
   std::optional<std::string> process;  // its id, in decimal
+  std::optional<std::string> user;     // its real user id, in decimal
 };
 
 // The calling process, now.
