@@ -31,9 +31,9 @@ class Entry:
     """One journal entry. `at` is in seconds relative to now, `mono` in microseconds since boot."""
 
     def __init__(self, fields, at=-60.0, mono=None, boot=DEFAULT_BOOT, exe="/opt/Clock.AppDir/usr/bin/Clock",
-                 comm="Clock", pid=4711, uid=None):
+                 comm="Clock", pid=4711, uid=None, owner=None):
         self.fields, self.at, self.boot, self.exe, self.comm, self.pid = list(fields), at, boot, exe, comm, pid
-        self.uid = uid
+        self.uid, self.owner = uid, owner
         self.mono = mono if mono is not None else int((1_000_000 + at) * 1_000_000)
 
     def realtime(self, now):
@@ -78,7 +78,8 @@ def export_bytes(entries, now, first_sequence=1):
         head = [("__CURSOR", cursor), ("__REALTIME_TIMESTAMP", str(realtime)),
                 ("__MONOTONIC_TIMESTAMP", str(entry.mono)), ("_BOOT_ID", entry.boot)]
         trusted = [("_EXE", entry.exe), ("_COMM", entry.comm), ("_PID", str(entry.pid) if entry.pid else None),
-                   ("_UID", None if entry.uid is None else str(entry.uid))]
+                   ("_UID", None if entry.uid is None else str(entry.uid)),
+                   ("_SYSTEMD_OWNER_UID", None if entry.owner is None else str(entry.owner))]
         fields = head + entry.fields + [pair for pair in trusted if pair[1] is not None]
         yield b"".join(_field(key, value) for key, value in fields) + b"\n"
 

@@ -6,6 +6,11 @@
 // writer can pass for another user. But a user can give his program any path, so within one user a
 // path proves little.
 //
+// The daemon can name neither owner nor executable of a process that has ended before it looked.
+// Such a process could be of any of the users that one owner hands out, thousands of them. So all
+// entries without both count for one user, the unknown one. The price: honest programs that live
+// only for a moment share that user, and a flood of such programs costs them their trace points.
+//
 // Threads: one at a time.
 
 #pragma once
@@ -29,12 +34,14 @@ struct Origin {
   StringRef image;
 };
 
-// The writer of an entry. A session has one owner, however many users its namespaces hand out. Only
-// what the journal daemon says counts.
+// The writer of an entry. A session has one owner, however many users its namespaces hand out. The
+// daemon looks up owner and executable of a living process alike. So if there is an executable but
+// no owner, the process belongs to no session, as a system service, and its user counts.
 inline Origin writerOf(const TracePointTable& table, const PointTokens& tokens) {
-  const auto owner = table.user(tokenOf(tokens, FieldKind::sessionOwner));
-  return {owner ? owner : table.user(tokenOf(tokens, FieldKind::user)),
-          table.text(tokenOf(tokens, FieldKind::imagePath))};
+  const FieldToken image = tokenOf(tokens, FieldKind::imagePath);
+  auto user = table.user(tokenOf(tokens, FieldKind::sessionOwner));
+  if (!user && image != kNoToken) user = table.user(tokenOf(tokens, FieldKind::user));
+  return {user, table.text(image)};
 }
 
 // A user can make any number of programs, so writers are bounded. A writer takes 100 bytes and at

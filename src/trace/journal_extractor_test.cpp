@@ -139,13 +139,15 @@ TEST_F(SharesTest, theLastQuarterIsForThoseWhoHoldLittle) {
   EXPECT_EQ(got("|_UID=2|_EXE=/b", 50), 0u);
   EXPECT_EQ(got("|_UID=3|_SYSTEMD_OWNER_UID=1|_EXE=/g", 50), 0u) << "a session has one owner";
   EXPECT_EQ(got("|_UID=3|_SYSTEMD_OWNER_UID=4|_EXE=/g", 50), 16u);
-  EXPECT_EQ(got("", 50), 16u) << "the unknown writer";
+  EXPECT_EQ(got("|_UID=7", 50), 16u) << "without owner and executable: the unknown writer";
+  EXPECT_EQ(got("|_UID=8", 50) + got("", 50), 0u) << "he is one, whatever users he had";
+  EXPECT_EQ(got("|_UID=8|_SYSTEMD_OWNER_UID=9", 50), 16u);
   process({tracePoint("event|CATEGORY=100000|_UID=1|_EXE=/f")});
   EXPECT_EQ(delivered.back(), "Event 100000") << "who holds a pair does not matter";
   EXPECT_EQ(extractor().report().pairs, delivered.size() - 1);
   EXPECT_THAT(losses(), Contains("156 beyond_pair_limit: too many pairs of subsystem and category "
                                  "(user 1, /a)"));
-  EXPECT_THAT(losses(), Contains("34 beyond_pair_limit: too many pairs of subsystem and category "
+  EXPECT_THAT(losses(), Contains("134 beyond_pair_limit: too many pairs of subsystem and category "
                                  "(unknown user, unknown)"));
   limits.shares.pairs = 4096;
   limits.shares.pairBytes = 64 * 1024;
@@ -198,17 +200,17 @@ TEST_F(SharesTest, timeAndTextCostTheirWriter) {
     return true;
   };
   limits.shares.pairs = 1'000'000;
-  const std::string honest = "|_UID=2|TELEMETRY=1", junk = "|_UID=1|TELEMETRY=1";
+  const std::string honest = "|_UID=2|_EXE=/a|TELEMETRY=1", junk = "|_UID=1|_EXE=/a|TELEMETRY=1";
   startCharged(64, kNoLimit);
   EXPECT_EQ(got(junk, 3000), 36'000u / 25) << "each step costs 12.5 ms, whichever one sleeps";
   EXPECT_EQ(got(honest, 50), 50u);
   rest = std::chrono::milliseconds{75};
   startCharged(64, kNoLimit);
   EXPECT_EQ(got(junk, 3000), 360u) << "what else the callback takes is added";
-  EXPECT_EQ(got("|_UID=3", 10), 10u);
+  EXPECT_EQ(got("|_UID=3|_EXE=/a", 10), 10u);
   EXPECT_EQ(got(junk, 7), 0u);
   EXPECT_THAT(losses(), ElementsAre("2647 beyond_time_limit: too much of the time of a run "
-                                    "(user 1, unknown)"));
+                                    "(user 1, /a)"));
   rest = std::chrono::hours{8};
   startCharged(64, kNoLimit);
   EXPECT_EQ(got(junk, 3), 3u) << "a machine that slept costs a sixteenth";

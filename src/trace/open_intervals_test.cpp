@@ -72,7 +72,7 @@ TEST_F(OpenIntervalsTest, whoHoldsMostLosesHisOldest) {
   EXPECT_EQ(losses.all()[0].count, assembler().counts().droppedOpenIntervals);
   // With one each, everybody is the one who holds most. Somebody goes, and nothing else happens.
   for (uint32_t user = 10; user < 60; ++user)
-    run({"begin|INTERVAL_ID=1|_UID=" + std::to_string(user)});
+    run({"begin|INTERVAL_ID=1|_EXE=/a|_UID=" + std::to_string(user)});
   EXPECT_EQ(assembler().counts().openIntervals, 1u) << "the same key replaces";
   for (int i = 0; i < 3000; ++i) {
     const std::string user = std::to_string(i * 7919 % 50), image = std::to_string(i % 9);
