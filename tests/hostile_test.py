@@ -118,6 +118,15 @@ class Flood(MachineTest):
         self.assertEqual((lost["uid"], lost["count"]), (HOSTILE, 2000 - names.count("ts__com.vantor.Flood__View__N")))
         self.assertAlmostEqual(lost["count"], 2000 - 24 * 9 / 16 / 0.025, delta=20)
 
+    def test_a_begin_pays_for_its_executable(self):
+        def half(kind, first, i, **fields):
+            return point(kind, "com.vantor.Honest", "View", "N", interval=str(i), scope="system", at=first + i * 0.001, **fields)
+
+        begins = [half("begin", -50, i, uid=HOSTILE, exe=f"/{i}/".ljust(3900, "x")) for i in range(1500)]
+        self.machine.write_export(begins + [half("end", -20, i, uid=HONEST) for i in range(1500)])
+        summary = json.loads(self.assert_clean(self.machine.ctl("explain", "--summary", "--json")).out)
+        self.assertEqual({loss["uid"] for loss in summary["over_share"]}, {HOSTILE})
+
     def test_text_for_the_spool_runs_out(self):
         long = [chr(1) * 4000 + str(i) for i in range(200)]  # six bytes of JSON for each character
         junk = (point("event", "com.vantor.Flood", "View", "N", string1=("a", value), at=-3600 + i * 0.001, uid=HOSTILE)

@@ -30,9 +30,8 @@ bool Shares::weighs(const ObjectOffer& offer) {
     std::ranges::fill(recentPairs_, 0);
     generation_ = offer.table.generation();
   }
-  const Origin writer = offer.writer();
-  if (const auto reason = refusal(offer, writer)) {
-    writers_.lost(writers_.numberOf(writer), *reason);
+  if (const auto refused = refusal(offer)) {
+    writers_.lost(writers_.numberOf(refused->writer), refused->reason);
     ++refusals_;
     return false;
   }
@@ -44,21 +43,31 @@ bool Shares::weighs(const ObjectOffer& offer) {
 // overdraws a share by little. Only an object that is marked for telemetry can be reported, and the
 // process remembers the executables of reported objects only. A pair is held by whoever brought it
 // first, and then serves everybody.
-std::optional<LossCode> Shares::refusal(const ObjectOffer& offer, const Origin& writer) {
-  if (!mayTake(kTime, 1, writer)) return LossCode::beyondTimeLimit;
-  if (!mayTake(kRowBytes, 1, writer)) return LossCode::beyondTextLimit;
-  for (const FieldToken image : offer.images()) {
-    if (!offer.telemetryEnabled() || offer.table.noted(image)) continue;
-    const StringRef path = offer.table.text(image);
-    if (!hasOrTakes(images_, {path.hash(), 0}, sizeOf(path), kImages, kImageBytes, writer))
-      return LossCode::beyondImageLimit;
-    offer.table.note(image);
+std::optional<Shares::Refusal> Shares::refusal(const ObjectOffer& offer) {
+  const Origin writer = offer.writer();
+  if (!mayTake(kTime, 1, writer)) return Refusal{LossCode::beyondTimeLimit, writer};
+  if (!mayTake(kRowBytes, 1, writer)) return Refusal{LossCode::beyondTextLimit, writer};
+  if (offer.telemetryEnabled()) {
+    const Origin beginner = writerOf(offer.table, offer.begin);
+    if (!imageIsAdmitted(offer.table, offer.images()[0], beginner))
+      return Refusal{LossCode::beyondImageLimit, beginner};
+    if (!imageIsAdmitted(offer.table, offer.images()[1], writer))
+      return Refusal{LossCode::beyondImageLimit, writer};
   }
   const Key pair{offer.subsystem().hash(), offer.category().hash()};
   const size_t bytes = sizeOf(offer.subsystem()) + sizeOf(offer.category());
   if (!hasOrTakes(pairs_, pair, bytes, kPairs, kPairBytes, writer))
-    return LossCode::beyondPairLimit;
+    return Refusal{LossCode::beyondPairLimit, writer};
   return std::nullopt;
+}
+
+bool Shares::imageIsAdmitted(TracePointTable& table, FieldToken image, const Origin& writer) {
+  if (table.noted(image)) return true;
+  const StringRef path = table.text(image);
+  if (!hasOrTakes(images_, {path.hash(), 0}, sizeOf(path), kImages, kImageBytes, writer))
+    return false;
+  table.note(image);
+  return true;
 }
 
 bool Shares::hasOrTakes(Admitted& admitted, Key key, uint64_t bytes, Kind count, Kind text,

@@ -48,7 +48,8 @@ struct ShareLimits {
 };
 
 // An object before it is made: the tokens that it will be made of. For an event both are the same.
-// Whoever ends an interval makes us deliver it, so the object counts for the writer of the end.
+// Whoever ends an interval makes us deliver it, so the object counts for the writer of the end. He
+// cannot choose what runs at its begin, so that executable counts for the writer of the begin.
 struct ObjectOffer {
   TracePointTable& table;
   const PointTokens& begin;
@@ -111,8 +112,13 @@ class Shares {
     const uint64_t pair = offer.pair();
     return recentPairs_[((pair >> 32) * 37 + pair) % kRecentPairs];
   }
+  struct Refusal {
+    LossCode reason;
+    Origin writer;  // who had more than his share
+  };
   bool weighs(const ObjectOffer& offer);
-  std::optional<LossCode> refusal(const ObjectOffer& offer, const Origin& writer);
+  std::optional<Refusal> refusal(const ObjectOffer& offer);
+  bool imageIsAdmitted(TracePointTable& table, FieldToken image, const Origin& writer);
   bool hasOrTakes(Admitted& admitted, Key key, uint64_t bytes, Kind count, Kind text,
                   const Origin& writer);
   bool mayTake(Kind kind, uint64_t amount, const Origin& writer) {

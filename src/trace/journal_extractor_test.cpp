@@ -19,9 +19,11 @@ namespace tessel {
 namespace {
 
 using ::testing::Contains;
+using ::testing::Each;
 using ::testing::ElementsAre;
 using testing::FakeEntry;
 using testing::FakeEntryStream;
+using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using testing::tracePoint;
 using Lines = std::vector<std::string>;
@@ -176,6 +178,14 @@ TEST_F(SharesTest, programsAreSharedOutWhereTheyMayBeReported) {
   EXPECT_EQ(delivered.size(), 161u);
   EXPECT_EQ(losses().size(), 17u) << "sixteen programs and the others";
   EXPECT_EQ(extractor().report().store.reading.losses.sum(LossCode::beyondImageLimit), 52u);
+  limits.shares.images = 16;
+  startAfresh();
+  for (int i = 0; i < 20; ++i) {
+    process({tracePoint("begin|INTERVAL_SCOPE=system|_UID=1|_EXE=/" + std::to_string(i)),
+             tracePoint("end|INTERVAL_SCOPE=system|TELEMETRY=1|_UID=2|_EXE=/honest")});
+  }
+  EXPECT_THAT(losses(), Each(HasSubstr("(user 1, ")));
+  EXPECT_EQ(losses().size(), 12u) << "a begin cannot use up the share of whoever ends it";
 }
 
 // A service that takes two steps and some bytes for each object that is called "reported".
