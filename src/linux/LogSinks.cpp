@@ -48,7 +48,7 @@ constexpr struct {
     {"The journal daemon dropped entries: ", "4bd946453b0c49acbcadbee2afe8b087"},
     {"Entries are in no file of the trace store: ", "b1c6565b3ac74fb59a9d2fd41894851c"},
     {"Trace points were malformed: ", "aa58f7272a6b43bd9e8469473d0cd602"},
-    {"Writers had more than their share: ", "c406cfaadd0b41668e8fdd01c190de7c"},
+    {"Writers had more than their share, ", "c406cfaadd0b41668e8fdd01c190de7c"},
     {"A file in the state directory is not used: ", "dc9f4449558a4b44b8db8d735db6a79b"},
     {"The record of the run is not written: ", "5ec5b861dea7400ab6f514dfd29986f8"},
     {"The run is put off: ", "5404ba8a07bf4b149c0e56928bae46cd"},

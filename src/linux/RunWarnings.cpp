@@ -20,6 +20,7 @@ constexpr size_t kMaxForeignTextBytes = 256;
 // A run knows fewer reasons and set-aside files. The bound matters for a record that was read from
 // a file.
 constexpr size_t kMaxOfAKind = 16;
+constexpr std::string_view kObjectsLost = "Writers had more than their share, objects lost: ";
 
 // Codes that stand side by side and have one reason share a line. Losses whose code is not here
 // cost nobody a trace point: a point whose executable is unknown is reported under another name.
@@ -36,8 +37,14 @@ constexpr struct {
     {LossCode::entriesMissing, LossCode::entriesMissing, "numbers_in_no_file",
      "Entries are in no file of the trace store: "},
     {LossCode::malformed, LossCode::malformed, "malformed", "Trace points were malformed: "},
-    {LossCode::openIntervalDropped, static_cast<LossCode>(kLossCodes - 1), "over_share",
-     "Writers had more than their share: "},
+    // Begins and objects are different things, so a sum of both would mean nothing. Five lines at
+    // most, however many writers there are.
+    {LossCode::openIntervalDropped, LossCode::openIntervalDropped, "over_share",
+     "Writers had more than their share, begins lost: "},
+    {LossCode::beyondPairLimit, LossCode::beyondPairLimit, "over_share", kObjectsLost},
+    {LossCode::beyondImageLimit, LossCode::beyondImageLimit, "over_share", kObjectsLost},
+    {LossCode::beyondTextLimit, LossCode::beyondTextLimit, "over_share", kObjectsLost},
+    {LossCode::beyondTimeLimit, LossCode::beyondTimeLimit, "over_share", kObjectsLost},
 };
 
 std::string escaped(std::string_view text) { return shortPlainText(text, kMaxForeignTextBytes); }

@@ -56,6 +56,7 @@ TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
   RunRecord record = worstRun();
   auto codes = codesOf(record);
   EXPECT_EQ(std::ranges::count(codes, "rows_refused"), 16);
+  EXPECT_EQ(std::ranges::count(codes, "over_share"), 5) << "one for each reason, not each writer";
   EXPECT_EQ(runWarnings(record)[0].text,
             "The run was cut short: the last 2 minutes of its day were not read");
   codes.erase(std::unique(codes.begin(), codes.end()), codes.end());
@@ -95,10 +96,18 @@ TEST(RunWarningsTest, LossesOfACodeAreSummedUp) {
   losses.add(LossCode::fileSkipped, "Permission denied", {"/j/a.journal", {}}, 2);
   losses.add(LossCode::fileSkipped, "Permission denied", {"/j/b.journal", {}});
   losses.add(LossCode::filesNotLookedAt, "too many files to look at", {}, 4);
+  losses.add(LossCode::openIntervalDropped, "too many begins", {"/a", {}, 7}, 5);
+  losses.add(LossCode::beyondTimeLimit, "too much time", {"/a", {}, 7}, 2);
+  losses.add(LossCode::beyondTimeLimit, "too much time", {"/b", {}, 8});
   testing::RecordingLog log(LogLevel::error);
   logRunWarnings(record);
-  EXPECT_THAT(log.lines(), ::testing::ElementsAre("Files of the trace store were not read: 7; the "
-                                                  "first: Permission denied (/j/a.journal)"));
+  EXPECT_THAT(log.lines(),
+              ::testing::ElementsAre("Files of the trace store were not read: 7; the first: "
+                                     "Permission denied (/j/a.journal)",
+                                     "Writers had more than their share, begins lost: 5; the "
+                                     "first: too many begins (user 7, /a)",
+                                     "Writers had more than their share, objects lost: 3; the "
+                                     "first: too much time (user 7, /a)"));
 }
 
 }  // namespace
