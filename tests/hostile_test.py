@@ -118,6 +118,29 @@ class Flood(MachineTest):
         self.assertEqual((lost["uid"], lost["count"]), (HOSTILE, 2000 - names.count("ts__com.vantor.Flood__View__N")))
         self.assertAlmostEqual(lost["count"], 2000 - 24 * 9 / 16 / 0.025, delta=20)
 
+    def test_marked_floods_of_every_kind_in_one_store(self):
+        """What is marked also costs rows and time. With 24 seconds a sixteenth is just enough for 50 objects."""
+        def flood(i):
+            text, long = ODD[i % len(ODD)], f"{i}-".ljust(4096, "v")
+            common = {"at": -3600 + i * 0.001, "uid": HOSTILE, "exe": "/opt/" + text}
+            yield point("event", "com.vantor.Flood", f"Category {i}", "N", **common)
+            yield point("begin", "com.vantor.Flood", "Open", "N", interval=str(i), **common)
+            yield point("begin", "com.vantor.Flood", "Open", "N", interval=f"again {i}", **common)
+            yield point("event", text or "x", text[::-1] or "x", text, string1=(text, f"{i}{text}"), **common)
+            if i % 20 == 0:
+                yield point("event", "com.vantor.Flood", "Long", long, string1=(long, long[::-1]),
+                            attributes=[(str(k), long[2 + k:]) for k in range(8)], **common)
+
+        count = max(POINTS, MAX_OPEN_INTERVALS // 2 + 1000)
+        floods = itertools.chain.from_iterable(map(flood, range(count)))
+        self.run_flood(itertools.chain(honest("begin", -4000, "View"), floods, honest("end", -5, "View")), TESSEL_RUN_LIMIT="24")
+        self.assertEqual([name for name, _ in self.machine.rows()].count("ts__com.vantor.Honest__View__N"), 50)
+        with open(os.path.join(self.machine.state, "last_run.json"), encoding="utf-8") as file:
+            record = json.load(file)
+        self.assertEqual(record["outcome"], "completed")
+        lost = {(loss["code"], loss["uid"]) for loss in record["reading"]["losses"] if "uid" in loss}
+        self.assertEqual(lost, {("open_interval_dropped", HOSTILE), ("beyond_time_limit", HOSTILE)})
+
     def test_a_begin_pays_for_its_executable(self):
         def half(kind, first, i, **fields):
             return point(kind, "com.vantor.Honest", "View", "N", interval=str(i), scope="system", at=first + i * 0.001, **fields)
