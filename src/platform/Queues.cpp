@@ -69,8 +69,16 @@ bool tryStartThread(const Closure& body) {
 
 }  // namespace
 
-void startThread(Closure body) {
+void startThread(const Closure& body) {
   while (!tryStartThread(body)) std::this_thread::sleep_for(kThreadRetry);
+}
+
+bool startThread(const Closure& body, std::chrono::milliseconds patience) {
+  for (auto waited = std::chrono::milliseconds{0}; !tryStartThread(body); waited += kThreadRetry) {
+    if (waited >= patience) return false;
+    std::this_thread::sleep_for(kThreadRetry);
+  }
+  return true;
 }
 
 struct WorkerQueue::State {

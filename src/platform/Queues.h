@@ -78,7 +78,9 @@ class QueueFactory {
 
 // Runs `body` on a new thread that nobody joins. A system that has no thread to give may have one a
 // moment later, so the call then waits and tries again.
-void startThread(Closure body);
+void startThread(const Closure& body);
+// The same, but false if the system had no thread to give for as long as `patience`.
+bool startThread(const Closure& body, std::chrono::milliseconds patience);
 
 // Where a queue gets its thread from.
 enum class QueueThread {

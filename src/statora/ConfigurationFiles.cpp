@@ -21,7 +21,6 @@
 #include <cerrno>
 #include <chrono>
 #include <filesystem>
-#include <system_error>
 #include <thread>
 #include <utility>
 
@@ -73,6 +72,10 @@ std::variant<ConfigurationFile, PlatformError> lookAtConfiguration(const std::st
 namespace {
 
 constexpr std::chrono::milliseconds kLookInterval{50};
+
+// How long the first look may wait for a thread. The tasking gate waits 5 s for a configuration, so
+// a lack of threads that passes within this time costs no run.
+constexpr std::chrono::milliseconds kPatienceForAThread{2000};
 
 // What the watching thread works on. The observer shares it, to end the thread through `ended`.
 struct Watch {
@@ -169,14 +172,12 @@ class FileObserver final : public ConfigurationObserver,
     // A type with a slash would lead out of the directory.
     if (watch_ || type.find('/') != std::string::npos) return;
     watch_ = std::make_shared<Watch>(directory_, type);
-    try {
-      std::thread([watch = watch_, observer = weak_from_this()] {
-        observe(*watch, observer);
-      }).detach();
-    } catch (const std::system_error& error) {
-      // Without a thread the delegate is never called. That is no word on the configuration.
-      sayBlind(*watch_, {ErrorCode::failed, error.what()});
-    }
+    const auto watching = [watch = watch_, observer = weak_from_this()] {
+      observe(*watch, observer);
+    };
+    // Without a thread the delegate is never called. That is no word on the configuration.
+    if (!startThread(watching, kPatienceForAThread))
+      sayBlind(*watch_, {ErrorCode::failed, "there is no thread for it"});
   }
 
   bool blind() const override { return watch_ && watch_->blind; }
