@@ -65,7 +65,8 @@ void EventRoad::send(const std::shared_ptr<const TesselObject>& object,
   // nothing.
   const size_t bytes = payloadJson(*payload).size();
   queuedBytes_ += sender_.spaceOf(bytes + kFixedEventName.size());
-  if (hasEventName(*object)) queuedBytes_ += sender_.spaceOf(bytes + eventName(*object).size());
+  if (hasEventName(*object))
+    queuedBytes_ += sender_.spaceOf(bytes + replaceInvalidUtf8(eventName(*object)).size());
   // The throttle sleeps on this thread, which is the one that delivers objects. The extractor
   // therefore slows down to the pace of the sends. If the queue slept instead, it would fill up.
   throttle_.throttleReportedEvent();

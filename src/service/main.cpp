@@ -112,6 +112,7 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   ExtractionLimits limits;
   limits.shares.rowBytes = spoolLimits(launch).ofARun();
+  limits.shares.spaceOfRow = &spaceOfRow;
   if (launch.runLimit.count() != 0)
     limits.shares.nanoseconds =
         static_cast<uint64_t>(std::chrono::nanoseconds(launch.runLimit).count());

@@ -3,8 +3,11 @@
 #include "trace/Shares.h"
 
 #include <algorithm>
+#include <string>
 
 #include "platform/Invariant.h"
+#include "platform/Json.h"
+#include "platform/Text.h"
 
 namespace tessel {
 
@@ -15,14 +18,37 @@ constexpr uint64_t sixteenth(uint64_t whole) { return whole / 16; }
 
 size_t sizeOf(StringRef text) { return text.textOr("").size(); }
 
+// More than the two rows of an object can take: a payload has at most 11 texts, and JSON makes
+// 24,000 bytes of the longest.
+constexpr uint64_t kMostSpaceOfObject = uint64_t{1} << 20;
+// Keys, numbers and constant texts of a payload.
+constexpr size_t kBesideTexts = 512;
+
+constexpr FieldKind kArguments[] = {FieldKind::string1Name, FieldKind::string1Value,
+                                    FieldKind::string2Name, FieldKind::string2Value,
+                                    FieldKind::number1Name, FieldKind::number2Name};
+
+size_t jsonSize(const ObjectOffer& offer, FieldToken token) {
+  std::string json;
+  appendJsonString(json, offer.table.text(token).textOr(""));
+  return json.size();
+}
+
 }  // namespace
 
 Shares::Shares(Writers& writers, const ShareLimits& limits)
-    : writers_(writers), limits_{limits.pairs,      limits.pairBytes, limits.images,
-                                 limits.imageBytes, limits.rowBytes,  limits.nanoseconds} {
+    : writers_(writers),
+      limits_{limits.pairs,      limits.pairBytes, limits.images,
+              limits.imageBytes, limits.rowBytes,  limits.nanoseconds},
+      spaceOfRow_(limits.spaceOfRow) {
   for (size_t kind = 0; kind < kKinds; ++kind)
     openToAll_[kind] = threeQuarters(threeQuarters(limits_[kind]));
-  scarce_ = openToAll_[kTime] == 0 || openToAll_[kRowBytes] == 0;
+  noteScarcity();
+}
+
+void Shares::noteScarcity() {
+  scarce_ = given_[kTime] >= openToAll_[kTime] ||
+            given_[kRowBytes] + kMostSpaceOfObject > openToAll_[kRowBytes];
 }
 
 bool Shares::weighs(const ObjectOffer& offer) {
@@ -39,14 +65,36 @@ bool Shares::weighs(const ObjectOffer& offer) {
   return true;
 }
 
-// What an object costs in time and text shows only afterwards, so 1 stands for it here. One object
-// overdraws a share by little. Only an object that is marked for telemetry can be reported, and the
-// process remembers the executables of reported objects only. A pair is held by whoever brought it
-// first, and then serves everybody.
+// What the rows of an object take at most, for rows are what a neighbour can make large: one object
+// must not take at once what is kept for others. A bundle's identifier and an override of it are
+// not known yet; they are charged with the rest. Only an object that is marked for telemetry can be
+// reported.
+uint64_t Shares::spaceOf(const ObjectOffer& offer) const {
+  if (limits_[kRowBytes] == kNoLimit || !offer.telemetryEnabled()) return 1;
+  size_t name = 0;
+  size_t payload = kBesideTexts;
+  for (const FieldKind kind : {FieldKind::subsystem, FieldKind::category, FieldKind::name}) {
+    const FieldToken token = tokenOf(offer.end, kind);
+    name += replaceInvalidUtf8(offer.table.text(token).textOr("")).size();
+    payload += jsonSize(offer, token);
+  }
+  payload += jsonSize(offer, tokenOf(offer.begin, FieldKind::processName)) +
+             jsonSize(offer, tokenOf(offer.end, FieldKind::processName));
+  for (const FieldKind kind : kArguments) {
+    payload += std::max(jsonSize(offer, tokenOf(offer.begin, kind)),
+                        jsonSize(offer, tokenOf(offer.end, kind)));
+  }
+  return spaceOfRow_(payload) + spaceOfRow_(payload + name);
+}
+
+// What an object costs in time shows only afterwards, so 1 stands for it here. One object overdraws
+// that share by little. The process remembers the executables of reported objects only. A pair is
+// held by whoever brought it first, and then serves everybody.
 std::optional<Shares::Refusal> Shares::refusal(const ObjectOffer& offer) {
   const Origin writer = offer.writer();
   if (!mayTake(kTime, 1, writer)) return Refusal{LossCode::beyondTimeLimit, writer};
-  if (!mayTake(kRowBytes, 1, writer)) return Refusal{LossCode::beyondTextLimit, writer};
+  if (!mayTake(kRowBytes, spaceOf(offer), writer))
+    return Refusal{LossCode::beyondTextLimit, writer};
   if (offer.telemetryEnabled()) {
     const Origin beginner = writerOf(offer.table, offer.begin);
     if (!imageIsAdmitted(offer.table, offer.images()[0], beginner))
@@ -119,7 +167,7 @@ void Shares::charge(const Origin& origin, uint64_t rowBytes, uint64_t nanosecond
   const uint32_t writer = writers_.numberOf(origin);
   take(kRowBytes, rowBytes, writer);
   take(kTime, std::min(nanoseconds, sixteenth(limits_[kTime])), writer);
-  scarce_ = given_[kTime] >= openToAll_[kTime] || given_[kRowBytes] >= openToAll_[kRowBytes];
+  noteScarcity();
 }
 
 }  // namespace tessel

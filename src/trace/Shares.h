@@ -43,8 +43,10 @@ struct ShareLimits {
   uint64_t pairBytes = uint64_t{4} << 20;  // of all subsystems and categories together
   uint64_t images = 4096;
   uint64_t imageBytes = uint64_t{4} << 20;  // of all paths together
-  uint64_t rowBytes = kNoLimit;             // of the rows that a run sends
-  uint64_t nanoseconds = kNoLimit;          // that a run may take
+  uint64_t rowBytes = kNoLimit;             // of the spool, for the rows of objects
+  // What a row with so many bytes of text takes of rowBytes.
+  uint64_t (*spaceOfRow)(size_t textBytes) = [](size_t textBytes) -> uint64_t { return textBytes; };
+  uint64_t nanoseconds = kNoLimit;  // that a run may take
 };
 
 // An object before it is made: the tokens that it will be made of. For an event both are the same.
@@ -78,7 +80,7 @@ class Shares {
   Shares(Writers& writers, const ShareLimits& limits);
 
   // Whether the object may be delivered. Takes what the object needs, except for text and time,
-  // which only show once it was delivered. A refusal is noted as a loss of its writer.
+  // whose true cost only shows once it was delivered. A refusal is noted as a loss of its writer.
   bool admits(const ObjectOffer& offer) {
     // Nearly every object brings nothing new, while there is enough of everything.
     if (offer.table.generation() == generation_ && recentPair(offer) == offer.pair() &&
@@ -117,6 +119,8 @@ class Shares {
     Origin writer;  // who had more than his share
   };
   bool weighs(const ObjectOffer& offer);
+  uint64_t spaceOf(const ObjectOffer& offer) const;
+  void noteScarcity();
   std::optional<Refusal> refusal(const ObjectOffer& offer);
   bool imageIsAdmitted(TracePointTable& table, FieldToken image, const Origin& writer);
   bool hasOrTakes(Admitted& admitted, Key key, uint64_t bytes, Kind count, Kind text,
@@ -129,11 +133,12 @@ class Shares {
 
   Writers& writers_;
   const Amounts limits_;
+  uint64_t (*const spaceOfRow_)(size_t);
   Amounts openToAll_{};  // up to here nobody's share is looked at
   Amounts given_{};
   std::vector<Amounts> byUser_;
   std::vector<Amounts> byWriter_;
-  bool scarce_ = false;  // whether text or time are given away up to openToAll_
+  bool scarce_ = false;  // whether the next object may take more text or time than openToAll_
   Admitted pairs_;
   Admitted images_;
   // The last pairs that were admitted, by their tokens, and the generation of these. A comparison

@@ -206,7 +206,7 @@ TEST_F(SharesTest, timeAndTextCostTheirWriter) {
     throttle.throttleReportedEvent();
     throttle.throttleReportedEvent();
     clock.advance(rest);
-    spending.rowBytes += 100;
+    spending.rowBytes += 10'000;
     return true;
   };
   limits.shares.pairs = 1'000'000;
@@ -225,10 +225,14 @@ TEST_F(SharesTest, timeAndTextCostTheirWriter) {
   startCharged(64, kNoLimit);
   EXPECT_EQ(got(junk, 3), 3u) << "a machine that slept costs a sixteenth";
   rest = {};
-  startCharged(1'000'000, 64'000);
+  startCharged(1'000'000, 6'400'000);
   EXPECT_EQ(got(junk, 3000), 360u);
   EXPECT_EQ(got(honest, 50), 40u);
   EXPECT_EQ(extractor().report().store.reading.losses.sum(LossCode::beyondTextLimit), 2650u);
+  startCharged(1'000'000, 64'000);
+  const std::string text(4000, '\x01');  // six bytes of JSON for each character
+  EXPECT_EQ(got(junk, 1, "|STRING1_NAME=" + text), 0u) << "too large at once";
+  EXPECT_EQ(got(honest, 1), 1u);
 }
 
 TEST_F(JournalExtractorTest, anEarlyStopReturnsAtOnce) {
