@@ -18,7 +18,8 @@ namespace {
 // A year. A longer wait is surely a typing mistake, and sums of such times cannot overflow.
 constexpr int64_t kMaxSeconds = 31'536'000;
 constexpr int64_t kMaxDays = 36'500;  // a hundred years, for the same reason
-// A run may fill an eighth of the spool. An eighth of 4 MiB holds four rows of the largest size.
+// A run may take an eighth of what is free. Of an empty spool of 4 MiB its objects get room for 450
+// usual ones. An object of the largest size, 240 KB, is over its share there.
 constexpr int64_t kMinSpoolBytes = int64_t{4} << 20;
 constexpr int64_t kMaxSpoolBytes = int64_t{1} << 40;
 constexpr size_t kMaxQuotedValue = 256;  // so that the error stays one readable line

@@ -97,10 +97,6 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
   }
 }
 
-SpoolLimits spoolLimits(const LaunchConfiguration& launch) {
-  return {launch.spoolLimitBytes, launch.spoolDays};
-}
-
 // Makes the parts that take an object from the store to the spool.
 TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& variant, Spool& spool,
                           QueueFactory& queues, SerialQueue& reportingQueue, Clock& clock,
@@ -111,13 +107,14 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
   auto& identity = keep<ProcessIdentity>(keep<AppBundles>(volumes));
   auto& summary = keep<RunSummary>(spool, throttle, clock, keep<IcuDates>(), status);
   ExtractionLimits limits;
-  limits.shares.rowBytes = spoolLimits(launch).ofARun();
   limits.shares.spaceOfRow = &spaceOfRow;
   if (launch.runLimit.count() != 0)
     limits.shares.nanoseconds =
         static_cast<uint64_t>(std::chrono::nanoseconds(launch.runLimit).count());
-  const auto makeExtractor = [store = launch.traceStore, limits, &status, &throttle, &road,
-                              &clock] {
+  const auto makeExtractor = [store = launch.traceStore, limits, &status, &throttle, &road, &clock,
+                              &spool, &reportingQueue]() mutable {
+    // Only this queue may use the spool.
+    reportingQueue.sync([&] { limits.shares.rowBytes = spool.beginRun(); });
     // The poll of a past run keeps a weak reference. make_shared() puts the object and its counter
     // into one block, so a weak reference would keep the memory of the whole extractor.
     std::shared_ptr<JournalExtractor> extractor(new JournalExtractor(store, limits));
@@ -143,7 +140,8 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& gate = keep<TaskingGate>(variant, configurations, queues, clock);
   const auto writerQueue =
       std::make_shared<WorkerQueue>("tessel_reporter spool writer queue", QueueThread::own);
-  auto& spool = keep<Spool>(state.path(), spoolLimits(launch), clock, status, writerQueue, queues);
+  const SpoolLimits limits{launch.spoolLimitBytes, launch.spoolDays};
+  auto& spool = keep<Spool>(state.path(), limits, clock, status, writerQueue, queues);
   auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
                             [&spool, &state, &reportingQueue](const RunRecord& record) {

@@ -118,6 +118,7 @@ class Spool::Writer : public std::enable_shared_from_this<Writer> {
         flushedAt_(clock.continuousTicks()) {}
 
   // On the reporting queue.
+  uint64_t beginRun();
   bool take(PendingRow row);
   SpoolFigures endRun();
   // On the writer's queue, once a second.
@@ -313,6 +314,12 @@ void Spool::Writer::tick() {
   flush();
 }
 
+uint64_t Spool::Writer::beginRun() {
+  uint64_t bytes = 0;
+  queue_->sync([this, &bytes] { bytes = database_.bytesForObjects(); });
+  return bytes;
+}
+
 SpoolFigures Spool::Writer::endRun() {
   SpoolFigures ended;
   queue_->sync([this, &ended] {
@@ -339,7 +346,7 @@ void Spool::Writer::finishRun() {
   figures_.expired = database_.expire(clock_.now(), [this] { status_.progress(); });
   flush();
   database_.close();
-  database_.beginRun();
+  database_.endRun();
 }
 
 void Spool::Writer::giveUp() {
@@ -372,6 +379,8 @@ bool Spool::sendEvent(std::string_view name, const Payload& payload, EventRank r
                         .rank = rank,
                         .refused = {}});
 }
+
+uint64_t Spool::beginRun() { return writer_->beginRun(); }
 
 SpoolFigures Spool::endRun() { return writer_->endRun(); }
 

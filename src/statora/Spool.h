@@ -34,6 +34,10 @@ struct SpoolFigures {
 // refused. While another client keeps the database locked, the rows wait in the buffer until the
 // run ends.
 //
+// A run may take an eighth of what is free when it begins, so each flood leaves seven eighths of
+// what it has found to the runs after it. The rows of its summary have a part of that for
+// themselves.
+//
 // A run that sends nothing makes no database. Each run opens it by its path, so it does not write
 // to a file that somebody has moved or removed.
 //
@@ -54,6 +58,9 @@ class Spool final : public EventSender {
   bool sendEvent(std::string_view name, const Payload& payload, EventRank rank) override;
   uint64_t spaceOf(size_t textBytes) const override { return spaceOfRow(textBytes); }
 
+  // Begins a run. Answers how many bytes, by spaceOf(), the events of its objects may take
+  // together.
+  uint64_t beginRun();
   // Ends a run. Waits until each row is stored or has failed, removes rows that have stood there
   // too long, flushes and closes the database. Answers the figures of the run; those of the next
   // run begin at zero.

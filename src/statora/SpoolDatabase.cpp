@@ -63,13 +63,35 @@ constexpr int kPagesVacuumedAtOnce = 256;
 // ones, so the search goes on for so many rows. To read the whole spool would take seconds.
 constexpr size_t kNewerRowsLookedAt = 16384;
 
-// Pages that a row must leave free, for those of a higher rank. The events of the counts are at
-// most 30 a run, and their text seldom fills a page; a row of statistics is shorter than a page.
-int64_t pagesKeptFrom(EventRank rank, int64_t maxPages) {
-  constexpr int64_t kForStatistics = 2 + kPagesBesideRow;
+// A run may take an eighth of what is free when it begins. So each run that floods the spool leaves
+// seven eighths of what it has found to the next one. The price is that a run's part shrinks: after
+// 30 floods in a row, when the rows of the first are past their days, a run may still take 2.3 MiB
+// of a spool of 1 GiB. A spool of 4 MiB has no room for objects after 17. An eighth of the limit
+// was discarded, because the floods of eight days would fill the spool for a month.
+constexpr int64_t kRunShare = 8;
+
+// Pages that the rows of the summary need: one row of statistics, shorter than a page, and at most
+// 30 counts. A count whose subsystem and category are as long as they may be takes 13 pages. Where
+// 30 of these would be more than an eighth of what the run may take, an eighth is kept for them.
+constexpr int64_t kForStatistics = 2 + kPagesBesideRow;
+constexpr int64_t kMostForCounts = 30 * 13;
+constexpr int64_t kLeastForCounts = 8;
+
+// Pages that a row must leave free, for those of a higher rank.
+int64_t pagesKeptFrom(EventRank rank, int64_t pagesOfRun) {
   if (rank == EventRank::statistics) return 0;
   if (rank == EventRank::count) return kForStatistics;
-  return kForStatistics + std::clamp<int64_t>(maxPages / 64, 8, 256);
+  return kForStatistics + std::clamp(pagesOfRun / 8, kLeastForCounts, kMostForCounts);
+}
+
+// Pages that a run may take of so many that are free. Even in a full spool the summary may use what
+// is kept for it; nothing is left to the objects then.
+int64_t shareOf(int64_t freePages) {
+  return std::max(freePages / kRunShare, kForStatistics + kLeastForCounts);
+}
+
+int64_t pagesForObjects(int64_t pagesOfRun) {
+  return pagesOfRun - pagesKeptFrom(EventRank::object, pagesOfRun);
 }
 
 int64_t valueOf(SqliteStatement& statement) {
@@ -106,11 +128,30 @@ void SpoolDatabase::setPatience(std::chrono::milliseconds patience) {
   if (database_.isOpen()) database_.setBusyTimeout(static_cast<int>(patience_.count()));
 }
 
-void SpoolDatabase::beginRun() {
+void SpoolDatabase::endRun() {
   firstIdOfRun_ = 0;
+  pagesOfRun_ = 0;
   takenByRun_ = 0;
   refusedForLog_ = false;
   setPatience(kPatience);
+}
+
+// A database that cannot be opened counts as empty: it may be damaged, and is then set aside. If it
+// is not, refusal() still keeps it within the limit.
+int64_t SpoolDatabase::pagesOfRun() {
+  if (pagesOfRun_ != 0) return pagesOfRun_;
+  if (exists()) ensureOpen();
+  const int64_t used = isOpen() ? valueOf(pageCount_) - valueOf(freePages_) : 0;
+  pagesOfRun_ = shareOf(maxPages_ - 2 * checkpointPages_ - used);
+  return pagesOfRun_;
+}
+
+// What is divided among the writers must be more than nothing. In a full spool they divide what an
+// empty one would offer, and each of their rows is then refused with the reason that it is full.
+uint64_t SpoolDatabase::bytesForObjects() {
+  const int64_t pages = pagesForObjects(pagesOfRun());
+  const int64_t ofEmpty = pagesForObjects(shareOf(maxPages_ - 2 * checkpointPages_));
+  return static_cast<uint64_t>((pages > 0 ? pages : ofEmpty) * kPageBytes);
 }
 
 SqliteStatus SpoolDatabase::ensureOpen() {
@@ -191,10 +232,11 @@ SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
 // never given to rows: the log needs it between two checkpoints.
 std::optional<SpoolFailure> SpoolDatabase::refusal(const PendingRow& row) {
   const uint64_t space = spaceOfRow(row.textBytes());
-  const int64_t kept = pagesKeptFrom(row.rank, maxPages_);
-  const uint64_t share = limits_.ofARun();
+  const int64_t kept = pagesKeptFrom(row.rank, pagesOfRun());
+  if (row.rank == EventRank::object && pagesForObjects(pagesOfRun()) == 0)
+    return SpoolFailure::limit;
   if (row.rank != EventRank::statistics &&
-      takenByRun_ + space + static_cast<uint64_t>(kept * kPageBytes) > share) {
+      takenByRun_ + space > static_cast<uint64_t>((pagesOfRun() - kept) * kPageBytes)) {
     return SpoolFailure::runShare;
   }
   const int64_t needed = static_cast<int64_t>(space) / kPageBytes + kPagesBesideRow;

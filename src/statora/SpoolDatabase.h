@@ -24,9 +24,6 @@ namespace tessel {
 struct SpoolLimits {
   uint64_t bytes = uint64_t{1} << 30;  // of the database and its write-ahead log together
   std::chrono::days days{30};          // how long a row may stay; zero: for ever
-
-  // What one run may take: an eighth. So a flood of one day leaves room for a week.
-  uint64_t ofARun() const { return bytes / 8; }
 };
 
 // Bytes of pages that rows of this length take one after another. A page holds as many short rows
@@ -53,6 +50,10 @@ class SpoolDatabase {
   // Whether there is a database at the path.
   bool exists() const;
 
+  // Bytes that the objects of this run may take, by spaceOfRow(). The first call fixes what the run
+  // may take, and opens the database if there is one.
+  uint64_t bytesForObjects();
+
   // Inserts the rows in one transaction. A row for which there is no room is left out and gets its
   // `refused`. After a failure none of the rows is in the database. Opens it if necessary.
   SqliteStatus insert(std::span<PendingRow> rows);
@@ -72,8 +73,8 @@ class SpoolDatabase {
   // back to the file system. Answers how many rows were removed. `progress` is called at each step.
   uint64_t expire(Date now, const std::function<void()>& progress);
 
-  // Begins the books of the next run.
-  void beginRun();
+  // Ends the books of a run. REQUIRES: the database is closed.
+  void endRun();
   // Closes the database, which moves the log into it. Flush it before.
   void close();
   // Renames the database. Answers its new file name; absent if that failed.
@@ -91,6 +92,7 @@ class SpoolDatabase {
   SqliteStatus open();
   void forgetStatements();
   SqliteStatus insertEach(std::span<PendingRow> rows);
+  int64_t pagesOfRun();
   std::optional<SpoolFailure> refusal(const PendingRow& row);
   void checkpoint();
   bool expireNext(Search& search);
@@ -109,6 +111,7 @@ class SpoolDatabase {
   SqliteStatement insert_, pageCount_, freePages_;
   std::chrono::milliseconds patience_;
   int64_t firstIdOfRun_ = 0;    // 0 until the run has opened the database
+  int64_t pagesOfRun_ = 0;      // that the run may take; 0 until it is fixed
   uint64_t takenByRun_ = 0;     // bytes of pages
   int64_t pagesOfInsert_ = 0;   // of the transaction under way
   int64_t logPages_ = 0;        // after the last commit; 0 if the next one begins the log anew
