@@ -83,10 +83,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   StopFlag stop = false;
   FileReport report;
   const uint32_t number = nextNumber();
+  JournalReadResources& shared = resources(number);
   JournalEntryStream stream(
       std::make_unique<JournalFile>(UniqueFd(::dup(file)), beginning->fileSize, beginning->header,
-                                    resources(number).windows),
-      number, {resources(number), table, marks, stop, report});
+                                    shared.windows),
+      number, {shared, table, marks, stop, report});
   readAll(stream, table, size / 8);
   if (report.problems.all().size() > Losses::kMaxOfACode + 1) std::abort();
   return 0;
