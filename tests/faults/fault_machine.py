@@ -78,10 +78,11 @@ class FaultMachine(Machine):
     def run_faulty(self, environment=None, **faults):
         return self.result(self.start_faulty(environment, **faults))
 
-    def run_struck_at(self, at, **faults):
+    def run_struck_at(self, at, begin=lambda: None, **faults):
         """A run that is struck at that call. How many rows share a transaction differs from run to run, and so does
-        the number of calls: where a run makes fewer, the next one is struck earlier."""
+        the number of calls: where a run makes fewer, the next one is struck earlier. Calls begin() before each."""
         while True:
+            begin()
             try:
                 return self.run_faulty(AT=at, **faults)
             except NeverInjected:
