@@ -19,9 +19,9 @@ std::string runRecordPath(const std::string& stateDirectory);
 // read. The bound keeps a file that somebody else put there from filling the memory.
 inline constexpr size_t kMaxRunRecordBytes = size_t{1} << 20;
 
-// Replaces the record in the state directory. The file stays below 64 KiB whatever the store holds,
-// because the list of losses is bounded and long texts lose their middle. The error is absent if
-// that succeeded. REQUIRES: the run was tasked.
+// Replaces the record in the state directory. The file stays below 128 KiB whatever the store
+// holds, because the list of losses is bounded and long texts lose their middle. The error is
+// absent if that succeeded. REQUIRES: the run was tasked.
 std::optional<PlatformError> writeRunRecord(const RunRecord& record,
                                             const std::string& stateDirectory);
 
