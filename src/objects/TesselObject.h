@@ -69,6 +69,7 @@ struct TracePointFields {
   std::array<LabelledNumber, 2> numbers;
   float durationSeconds = 0;  // seconds
   bool telemetryEnabled = false;
+  bool statesDuration = false;  // the writer stated the duration; else it was measured, or is none
 };
 
 inline constexpr size_t kLabelledStrings = std::tuple_size_v<decltype(TracePointFields::strings)>;
@@ -95,6 +96,7 @@ class TesselObject : public TesselSupportObject {
   const std::optional<Number>& number2Value() const { return fields_.numbers[1].value; }
   float durationSeconds() const { return fields_.durationSeconds; }
   bool telemetryEnabled() const { return fields_.telemetryEnabled; }
+  bool statesDuration() const { return fields_.statesDuration; }
 
   // "TesselObject", "Event", "Interval" or "AnimationInterval".
   virtual std::string_view tesselType() const { return "TesselObject"; }

@@ -227,6 +227,7 @@ TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
                             number(labelled(FieldKind::number1Value, slot))};
   }
   fields.durationSeconds = duration == kNoToken ? measuredSeconds : table_.real(duration);
+  fields.statesDuration = duration != kNoToken;
   fields.telemetryEnabled = table_.flag(tokenOf(tokens, FieldKind::telemetry));
   return fields;
 }

@@ -68,6 +68,7 @@ void Tally::count(const TesselObject& object, const FilterDecision& decision,
   countSlice(decision.classification, entry.realtime);
   if (decision.classification == TesselReporterClassificationFailedStringWhitelist)
     countMiss(object, decision);
+  durations_.count(object);
 }
 
 void Tally::countPair(const TesselObject& object, TesselReporterClassification classification) {

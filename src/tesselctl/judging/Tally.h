@@ -2,7 +2,7 @@
 //
 // Its memory is bounded. The extraction limits the distinct (subsystem, category) pairs. The tally
 // itself limits the distinct values that the whitelist held back; it counts objects with further
-// values together. Threads: one at a time.
+// values together. Durations have bounds of their own. Threads: one at a time.
 
 #pragma once
 
@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "journal/EntryStream.h"
+#include "tesselctl/judging/Durations.h"
 #include "tesselctl/judging/Judge.h"
 #include "tesselctl/judging/KeyedCounts.h"
 #include "tesselctl/reading/TimeArguments.h"
@@ -64,6 +65,10 @@ class Tally {
   // Objects that the whitelist held back and that misses() does not list.
   uint64_t missesNotListed() const { return missesNotListed_; }
 
+  // Durations and frame rates of trace points, whatever their verdict: a point that is not reported
+  // takes as long.
+  const Durations& durations() const { return durations_; }
+
   // Equal parts of the period, in order; they begin at whole minutes, hours or days, local time.
   const std::vector<VerdictCounts>& slices() const { return slices_; }
   Date sliceStart(size_t slice) const {
@@ -85,6 +90,7 @@ class Tally {
   KeyedCounts<4, uint64_t> misses_;
   size_t missBytes_ = 0;
   uint64_t missesNotListed_ = 0;
+  Durations durations_;
   std::chrono::microseconds sliceLength_;
   Date firstSlice_;
   std::vector<VerdictCounts> slices_;

@@ -8,6 +8,7 @@
 #include <algorithm>
 
 #include "platform/Text.h"
+#include "tesselctl/showing/DurationOutput.h"
 #include "tesselctl/showing/Losses.h"
 
 namespace tessel::ctl {
@@ -282,6 +283,7 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
     json.object("verdicts", [&] { addVerdicts(json, tally.verdicts()); });
     writeKinds(json, tally);
     writePairs(json, tally);
+    addDurations(json, tally.durations());
     addMalformed(json, reading.losses);
     writeMisses(json, tally);
     writeIntervals(json, report.assembly);
@@ -301,6 +303,7 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
                     verdictTable(tally, terminal);
   if (tally.traceObjects() != 0)
     out += "\n" + kindTable(tally, terminal) + "\n" + pairTable(tally, terminal);
+  out += durationText(tally.durations(), terminal);
   // The verdict decides and not the list: the list may be full while objects were held back.
   if (tally.verdicts()[TesselReporterClassificationFailedStringWhitelist] != 0) {
     out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +

@@ -1,0 +1,27 @@
+// Durations and frame rates, as JSON and as text for people.
+//
+// Stateless; any thread.
+
+#pragma once
+
+#include <string>
+
+#include "platform/Json.h"
+#include "tesselctl/judging/Durations.h"
+#include "tesselctl/showing/Terminal.h"
+
+namespace tessel::ctl {
+
+// With three digits and the unit that suits: "12.3 ms", "1.25 h".
+std::string secondsText(float seconds);
+// Frames per second: "59.9 fps".
+std::string frameRateText(float rate);
+
+// Writes the members `durations` in seconds and `frame_rates` in frames per second, each with the
+// count of values that it does not list.
+void addDurations(JsonWriter& json, const Durations& durations);
+
+// The trace points with most values as tables; empty where there are no values.
+std::string durationText(const Durations& durations, const Terminal& terminal);
+
+}  // namespace tessel::ctl
