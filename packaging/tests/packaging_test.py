@@ -207,7 +207,7 @@ class Texts(unittest.TestCase):
                 with open(path, encoding="utf-8") as source:
                     warnings += re.findall(r'\.warning\(\s*"([^"]+)', source.read())
         self.assertTrue(warnings)
-        # "%@" alone stands for the texts of linux/RunWarnings.cpp, which have a test beside them.
+        # "%@" alone stands for the texts of linux/Findings.cpp, which have a test beside them.
         self.assertEqual([text for text in warnings if not text.startswith((*table, "%@"))], [])
 
     def test_completion(self):

@@ -13,7 +13,7 @@
 #include "linux/LaunchConfiguration.h"
 #include "linux/LogSinks.h"
 #include "linux/RunRecordFile.h"
-#include "linux/RunWarnings.h"
+#include "linux/Findings.h"
 #include "linux/Scheduler.h"
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"

@@ -1,6 +1,6 @@
 // The warnings of a finished run.
 
-#include "linux/RunWarnings.h"
+#include "linux/Findings.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

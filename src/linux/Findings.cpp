@@ -3,7 +3,7 @@
 // Each text begins with words of its own. By these words linux/LogSinks.cpp finds the identifier
 // under which `journalctl -x` explains the line, so they must stand in both places.
 
-#include "linux/RunWarnings.h"
+#include "linux/Findings.h"
 
 #include <algorithm>
 
