@@ -304,7 +304,9 @@ class Status(CtlTest):
         self.assert_clean(self.machine.run())
         summary = json.loads(self.machine.ctl("explain", "--summary", "--json").out)
         exit_status, status = self.status()
-        self.assertEqual((exit_status, status["good"]), (0, True), "losses of the store are none of the reporter")
+        codes = [[found["code"] for found in status[kind]] for kind in ("problems", "notes")]
+        self.assertEqual((exit_status, status["good"], codes), (1, False, [["store_unreadable", "store_damaged"],
+                                                                           ["dropped_by_daemon", "numbers_in_no_file"]]))
         reading = status["last_run"]["reading"]
         for told in (reading, summary):
             self.assertTrue(told["store"].pop("range_start"))  # of a moment of its own

@@ -16,7 +16,7 @@ namespace {
 
 std::vector<std::string> codesOf(const RunRecord& record) {
   std::vector<std::string> codes;
-  for (const RunWarning& warning : runWarnings(record)) codes.emplace_back(warning.code);
+  for (const Finding& found : findingsOf(record)) codes.emplace_back(findingName(found.code));
   return codes;
 }
 
@@ -43,7 +43,7 @@ RunRecord worstRun() {
   return record;
 }
 
-TEST(RunWarningsTest, AGoodRunHasNone) {
+TEST(FindingsTest, AGoodRunHasNone) {
   RunRecord record;
   record.rowsStored = record.rowsExpected();
   record.marker = "removed";
@@ -52,44 +52,45 @@ TEST(RunWarningsTest, AGoodRunHasNone) {
   EXPECT_THAT(codesOf(record), ::testing::IsEmpty());
 }
 
-TEST(RunWarningsTest, EveryReasonIsOneBoundedLineWithAnId) {
+TEST(FindingsTest, EveryReasonIsOneBoundedLineWithAnId) {
   RunRecord record = worstRun();
   auto codes = codesOf(record);
   EXPECT_EQ(std::ranges::count(codes, "rows_refused"), 16);
   EXPECT_EQ(std::ranges::count(codes, "over_share"), 5) << "one for each reason, not each writer";
-  EXPECT_EQ(runWarnings(record)[0].text,
+  EXPECT_EQ(findingsOf(record)[0].words,
             "The run was cut short: the last 2 minutes of its day were not read");
   codes.erase(std::unique(codes.begin(), codes.end()), codes.end());
   EXPECT_THAT(codes, ::testing::ElementsAre(
                          "run_cut_short", "marker_stuck", "rows_refused", "books_unbalanced",
-                         "rows_expired", "spool_damaged", "store_unreadable", "store_damaged",
+                         "rows_expired", "spool_set_aside", "store_unreadable", "store_damaged",
                          "dropped_by_daemon", "numbers_in_no_file", "malformed", "over_share"));
-  auto warnings = runWarnings(record);
+  auto warnings = findingsOf(record);
   for (const RunOutcome outcome : {RunOutcome::failed, RunOutcome::bailedOut}) {
     record.outcome = outcome;
     record.failure = std::string(4096, '\n');
-    warnings.push_back(runWarnings(record).front());
+    warnings.push_back(findingsOf(record).front());
   }
-  for (const auto& [code, text] : warnings) {
-    EXPECT_LT(text.size(), 1024u) << code;
-    EXPECT_EQ(text, plainText(text, "\\x0a")) << code;
+  for (const Finding& found : warnings) {
+    const std::string& text = found.words;
+    EXPECT_LT(text.size(), 1024u) << text;
+    EXPECT_EQ(text, plainText(text, "\\x0a"));
     EXPECT_THAT(journalFields(LogLevel::warning, "", "", text),
                 ::testing::Contains(::testing::StartsWith("MESSAGE_ID=")))
         << text;
   }
 }
 
-TEST(RunWarningsTest, EveryLossButAnUnknownImageIsOne) {
+TEST(FindingsTest, EveryLossButAnUnknownImageIsOne) {
   for (size_t code = 0; code < kLossCodes; ++code) {
     RunRecord record;
     record.rowsStored = record.rowsExpected();
     record.reading.emplace().losses.add(static_cast<LossCode>(code), "words", {});
     const size_t expected = static_cast<LossCode>(code) == LossCode::noImagePath ? 0 : 1;
-    EXPECT_EQ(runWarnings(record).size(), expected) << lossName(static_cast<LossCode>(code));
+    EXPECT_EQ(findingsOf(record).size(), expected) << lossName(static_cast<LossCode>(code));
   }
 }
 
-TEST(RunWarningsTest, LossesOfACodeAreSummedUp) {
+TEST(FindingsTest, LossesOfACodeAreSummedUp) {
   RunRecord record;
   record.rowsStored = record.rowsExpected();
   Losses& losses = record.reading.emplace().losses;
@@ -100,7 +101,7 @@ TEST(RunWarningsTest, LossesOfACodeAreSummedUp) {
   losses.add(LossCode::beyondTimeLimit, "too much time", {"/a", {}, 7}, 2);
   losses.add(LossCode::beyondTimeLimit, "too much time", {"/b", {}, 8});
   testing::RecordingLog log(LogLevel::error);
-  logRunWarnings(record);
+  logFindings(record);
   EXPECT_THAT(log.lines(),
               ::testing::ElementsAre("Files of the trace store were not read: 7; the first: "
                                      "Permission denied (/j/a.journal)",

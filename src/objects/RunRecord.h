@@ -78,10 +78,11 @@ struct RunRecord {
     return outcome == RunOutcome::completed || outcome == RunOutcome::interrupted;
   }
   uint64_t reported() const { return classified[TesselReporterClassificationTelemetryReported]; }
-  // Whether every inspected object has exactly one classification.
-  bool objectsBalance() const {
-    return std::accumulate(classified.begin(), classified.end(), uint64_t{0}) == inspected;
+  uint64_t classifiedSum() const {
+    return std::accumulate(classified.begin(), classified.end(), uint64_t{0});
   }
+  // Whether every inspected object has exactly one classification.
+  bool objectsBalance() const { return classifiedSum() == inspected; }
   // Rows that the run should have stored. A reported object makes two, or one if it lacks a full
   // name, or none if it has no payload. Each count event makes one, and so does the summary.
   uint64_t rowsExpected() const {

@@ -10,10 +10,10 @@
 #include <deque>
 
 #include "linux/AppBundles.h"
+#include "linux/Findings.h"
 #include "linux/LaunchConfiguration.h"
 #include "linux/LogSinks.h"
 #include "linux/RunRecordFile.h"
-#include "linux/Findings.h"
 #include "linux/Scheduler.h"
 #include "linux/ServiceRuntime.h"
 #include "linux/StateDirectory.h"
@@ -90,7 +90,7 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
     addRows(record, figures);
     record.addTotals(last ? last->totals : RowTotals{});
     record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
-    logRunWarnings(record);
+    logFindings(record);
   }
   if (const auto failure = writeRunRecord(record, stateDirectory)) {
     platformLog().warning("The record of the run is not written: %@", failure->words);

@@ -90,11 +90,29 @@ void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("last_success", counters.lastSuccess);
 }
 
+void writeFindings(JsonWriter& json, std::string_view name, const std::vector<Finding>& findings,
+                   bool problems) {
+  std::vector<Finding> wanted;
+  std::copy_if(findings.begin(), findings.end(), std::back_inserter(wanted),
+               [&](const Finding& found) { return isProblem(found.code) == problems; });
+  json.array(name, wanted, [&](const Finding& found) {
+    json.object([&] {
+      json.member("code", findingName(found.code)).member("words", found.words);
+      json.member("since", found.since).member("advice", found.advice);
+      json.member("command", found.command);
+      if (found.because) json.member("because", findingName(*found.because));
+    });
+  });
+}
+
 // A member stands for a fact that exists: without a run there is no "last_run", without a forwarder
 // no "forwarder". Zeros in their place would say that a run counted nothing.
 std::string statusJson(const ReporterStatus& status) {
   return objectLine([&](JsonWriter& json) {
     json.member("good", status.good());
+    json.array("checked", status.checked, [&](FindingCode code) { json.value(findingName(code)); });
+    writeFindings(json, "problems", status.findings, true);
+    writeFindings(json, "notes", status.findings, false);
     json.object("tasking", [&] {
       json.member("tasked", status.tasking.decision.on());
       json.member("source", taskingSourceName(status.tasking.decision.source()));

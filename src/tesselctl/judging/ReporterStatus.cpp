@@ -124,6 +124,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   status.spoolFailure = spool.reason();
   status.store = launch.traceStore;
   status.journal = lookAtJournal(launch.traceStore);
+  judge(status);
   return status;
 }
 

@@ -11,6 +11,7 @@
 #include <string_view>
 #include <vector>
 
+#include "linux/Findings.h"
 #include "linux/LaunchConfiguration.h"
 #include "objects/RunRecord.h"
 #include "platform/Error.h"
@@ -62,13 +63,13 @@ struct ReporterStatus {
   std::optional<std::string> store;  // absent: the machine's own journal
   JournalFacts journal;
 
+  // What is wrong and what is worth knowing, in the order of the codes: problems first.
+  std::vector<Finding> findings;
+  std::vector<FindingCode> checked;  // the problems that were looked for
+
   // Whether the last run sent anything: only then are there sums that must balance.
   bool hasBooks() const { return run && run->hasBooks(); }
-  bool good() const {
-    if (run && run->outcome == RunOutcome::failed) return false;
-    if (hasBooks() && (!run->objectsBalance() || !run->rowsBalance())) return false;
-    return spoolState != SpoolReader::State::damaged;
-  }
+  bool good() const { return findings.empty() || !isProblem(findings.front().code); }
   // Whether the journal reaches back as far as a run looks.
   bool keepsADay() const {
     return journal.oldest && *journal.oldest <= now - std::chrono::hours{24};
@@ -78,7 +79,11 @@ struct ReporterStatus {
   bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
 };
 
-// Reads all facts. A fact that cannot be read is absent; its reason is given if there is a place.
+// Fills `findings` and `checked` from the facts.
+void judge(ReporterStatus& status);
+
+// Reads all facts and judges them. A fact that cannot be read is absent; its reason is given if
+// there is a place.
 ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now);
 
 }  // namespace tessel::ctl
