@@ -247,7 +247,7 @@ int main(int argc, char** argv) {
   tessel::prepareProcess();
   tessel::blockSignal(SIGTERM);
   CLI::App app("Ships the events of the spool to an OpenTelemetry collector (OTLP/HTTP, JSON).");
-  app.set_version_flag("--version", TESSEL_VERSION);
+  app.set_version_flag("--version", "statora_forwarder " TESSEL_VERSION, "Print the version");
   app.footer(
       "Where to is OTEL_EXPORTER_OTLP_ENDPOINT's to say. See what would be sent:\n  "
       "statora_forwarder --dry-run");

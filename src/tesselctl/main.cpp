@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <memory>
+#include <sstream>
 
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/showing/Terminal.h"
@@ -38,6 +39,21 @@ std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& ar
   return command;
 }
 
+// The parser reports --help and --version as errors of status 0. Its other statuses are numbers of
+// its own, and a script knows only ours. It would write to the streams of C++, which report no full
+// disk and escape nothing that the command line holds. So it writes to a string, and we print that.
+int end(const CLI::App& app, const CLI::ParseError& error) {
+  std::ostringstream out;
+  std::ostringstream complaint;
+  if (app.exit(error, out, complaint) == 0) {
+    print(out.str());
+    return kDone;
+  }
+  const auto called = app.get_subcommands();
+  const std::string command = called.empty() ? "" : called.front()->get_name() + " ";
+  return fail(kUsage, std::string(error.what()) + "; see tesselctl " + command + "--help");
+}
+
 int run(std::vector<std::string> arguments) {
   Invocation invocation;
   invocation.command = takeCommand(arguments);
@@ -53,6 +69,8 @@ int run(std::vector<std::string> arguments) {
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);
   addReportCommand(app, invocation);
+  addColourOption(app, invocation);
+  app.set_version_flag("--version", "tesselctl " TESSEL_VERSION, "Print the version");
   // The parser would only say that a subcommand is missing. We name the word that is wrong.
   if (!arguments.empty() && !arguments[0].starts_with('-') &&
       app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
@@ -66,9 +84,7 @@ int run(std::vector<std::string> arguments) {
     if (app.get_subcommands().empty() && !app.remaining().empty()) {
       return fail(kUsage, "no command is called '" + app.remaining().front() + "'; see --help");
     }
-    // The parser reports --help as an error of status 0. Its other statuses are numbers of its own,
-    // and a script knows only ours.
-    return app.exit(error) == 0 ? kDone : kUsage;
+    return end(app, error);
   }
   return invocation.status;
 }
@@ -77,4 +93,10 @@ int run(std::vector<std::string> arguments) {
 
 }  // namespace tessel::ctl
 
-int main(int argc, char** argv) { return tessel::ctl::run({argv + 1, argv + argc}); }
+int main(int argc, char** argv) {
+  tessel::ctl::prepareOutput();
+  const int status = tessel::ctl::run({argv + 1, argv + argc});
+  // exit() would write what the buffer still holds and ignore a full disk.
+  tessel::ctl::flushOutput();
+  return status;
+}

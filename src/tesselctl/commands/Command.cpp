@@ -71,14 +71,26 @@ int warnOfUnreadFiles(const StoreReport& report, const std::optional<std::string
 
 // The environment is read by the code of the service. A variable that stops the service stops us
 // too, so we never show the figures of another store.
-std::optional<Surroundings> lookAround() {
+std::optional<Surroundings> lookAround(const Invocation& invocation) {
   auto launch = readLaunchConfiguration(processEnvironment());
   if (const auto* error = std::get_if<LaunchError>(&launch)) {
     fail(kUsage, error->line());
     return {};
   }
+  const ColourChoice choice = invocation.colour == "always"  ? ColourChoice::always
+                              : invocation.colour == "never" ? ColourChoice::never
+                                                             : ColourChoice::automatic;
   return Surroundings{std::get<LaunchConfiguration>(std::move(launch)), SystemClock().now(),
-                      terminalBehind(STDOUT_FILENO)};
+                      terminalBehind(STDOUT_FILENO, choice)};
+}
+
+// The option stands before a command and behind it, since users of other tools try both. The help
+// of each command shows it, from which the completion of the shell learns it.
+void addColourOption(CLI::App& app, Invocation& invocation) {
+  app.add_option("--color", invocation.colour,
+                 "Colours: auto (on a terminal, unless $NO_COLOR is set), always or never [auto]")
+      ->type_name("WHEN")
+      ->check(CLI::IsMember({"auto", "always", "never"}));
 }
 
 void addPeriodOptions(CLI::App& command, ReadingOptions& options) {

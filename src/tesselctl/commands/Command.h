@@ -34,6 +34,7 @@ struct Invocation {
   std::optional<std::vector<std::string>> command;
   // Set by the command that was called.
   int status = kDone;
+  std::string colour = "auto";  // --color
 };
 
 // What surrounds a command when it begins.
@@ -44,7 +45,7 @@ struct Surroundings {
 };
 // Reads the environment. If a variable makes no sense, prints its name on stderr and returns
 // nothing.
-std::optional<Surroundings> lookAround();
+std::optional<Surroundings> lookAround(const Invocation& invocation);
 
 // --- Adding a command.
 
@@ -54,7 +55,7 @@ template <typename Options>
 void setAction(CLI::App& command, Invocation& invocation, std::shared_ptr<Options> options,
                int (*run)(const Options&, const Surroundings&)) {
   command.callback([&invocation, options = std::move(options), run] {
-    const auto surroundings = lookAround();
+    const auto surroundings = lookAround(invocation);
     invocation.status = surroundings ? run(*options, *surroundings) : kUsage;
   });
 }
@@ -64,6 +65,9 @@ struct CommandText {
   const char* description;
   std::string footer;  // notes and examples below the options
 };
+
+// Adds --color. `invocation` must outlive `app`.
+void addColourOption(CLI::App& app, Invocation& invocation);
 
 // A subcommand, and the options that the parser fills in. The subcommand owns the options.
 template <typename Options>
@@ -78,6 +82,7 @@ AddedCommand<Options> addCommand(CLI::App& app, Invocation& invocation, const Co
   auto options = std::make_shared<Options>();
   CLI::App* command = app.add_subcommand(text.name, text.description);
   command->footer(text.footer);
+  addColourOption(*command, invocation);
   setAction(*command, invocation, options, run);
   return {*command, *options};
 }

@@ -257,8 +257,8 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
                            const Terminal& terminal) {
   Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
   for (const auto verdict : kVerdictOrder) {
-    sums.add({std::string(verdictName(verdict)), grouped(comparison.sides[0][verdict]),
-              grouped(comparison.sides[1][verdict])});
+    sums.add({std::string(verdictName(verdict)), terminal.number(comparison.sides[0][verdict]),
+              terminal.number(comparison.sides[1][verdict])});
   }
   Table table({{"CHANGE"},
                {"OBJECTS", Table::Align::right},
@@ -268,7 +268,7 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
     std::string rule = change.why;
     if (change.slot != 0) rule += " \"" + terminalText(change.value) + "\"";
     table.add({{change.starts ? "starts" : "stops", change.starts ? Colour::good : Colour::caution},
-               grouped(count),
+               terminal.number(count),
                terminalText(change.subsystem) + " / " + terminalText(change.category) + " / " +
                    terminalText(change.name),
                rule});
@@ -304,7 +304,7 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   if (comparison.error) return failToRead(*comparison.error, reading->store);
   print(options.json ? comparisonJson(comparison)
                      : comparisonText(comparison, options, surroundings.terminal));
-  std::fflush(stdout);
+  flushOutput();
   return warnOfUnreadFiles(comparison.unread, reading->store);
 }
 

@@ -1,8 +1,9 @@
-// events: what the spool holds, newest last.
+// events: what the spool holds, newest last, or one row of it as a whole.
 //
 // We read the database beside the service and never write to it. Rows are printed page by page, so
 // a spool of many megabytes needs no more memory than a page, or than the rows that -n asks for.
 
+#include <charconv>
 #include <chrono>
 #include <deque>
 #include <nlohmann/json.hpp>
@@ -26,6 +27,13 @@ struct EventsOptions {
   size_t newest = 0;  // 0: all
   bool follow = false;
   bool json = false;
+  std::optional<std::string> id;  // of `events show`
+
+  // Whether the options choose among the rows.
+  bool choose() const {
+    return period.given() || !names.empty() || !subsystems.empty() || !categories.empty() ||
+           newest != 0 || follow;
+  }
 };
 
 // SQLite does not tell other processes of a new row, so --follow must look. Five looks a second
@@ -76,7 +84,7 @@ std::string rowJson(const SpooledEvent& row) {
   });
 }
 
-// The payload as one line "path key=value ...". A glance is enough here; --json shows all of it.
+// The payload as one line "path key=value ...", which people read more easily than JSON.
 std::string glance(const Json& payload, std::string_view text) {
   if (!payload.is_object()) return terminalText(text);
   std::string path;
@@ -103,17 +111,80 @@ std::string shownName(std::string_view name) {
   return terminalText(name);
 }
 
+// Valid JSON with each member on a line of its own. The text is laid out and not parsed: a parser
+// would round numbers, and drop all but one of the members of the same name.
+std::string laidOut(std::string_view json) {
+  // A hostile payload may nest half a million deep. Full indentation would then take gigabytes.
+  constexpr size_t kDeepest = 40;  // steps, of two columns; deeper ones would leave the screen
+  std::string out;
+  size_t depth = 0;
+  bool quoted = false;
+  bool escaped = false;
+  const auto newLine = [&] { out.append(1, '\n').append(2 * std::min(depth, kDeepest), ' '); };
+  for (const char byte : json) {
+    if (quoted) {
+      out += byte;
+      quoted = escaped || byte != '"';
+      escaped = !escaped && byte == '\\';
+    } else if (byte == '{' || byte == '[') {
+      out += byte;
+      ++depth;
+      newLine();
+    } else if (byte == '}' || byte == ']') {
+      --depth;
+      // Nothing stood between the brackets if only the indentation follows the opening one.
+      const size_t last = out.find_last_not_of(" \n");
+      const bool empty = out[last] == (byte == '}' ? '{' : '[');
+      empty ? out.resize(last + 1) : newLine();
+      out += byte;
+    } else if (byte == ',') {
+      out += byte;
+      newLine();
+    } else if (byte == ':') {
+      out += ": ";
+    } else if (byte != ' ' && byte != '\t' && byte != '\n' && byte != '\r') {
+      out += byte;
+      quoted = byte == '"';
+    }
+  }
+  return out;
+}
+
+Date dateOf(const SpooledEvent& row) { return Date{std::chrono::microseconds{row.time}}; }
+
+// One row with everything in it.
+std::string wholeRow(const SpooledEvent& row, const Terminal& terminal) {
+  const auto line = [&](std::string_view label, const std::string& text) {
+    return terminal.paint(Colour::faint, label) + terminalText(text) + "\n";
+  };
+  std::string out = line("Id       ", std::to_string(row.id)) +
+                    line("Time     ", stampText(dateOf(row))) + line("Name     ", row.name);
+  if (!Json::accept(row.payload)) return out + line("No JSON  ", row.payload);
+  std::string escaped;
+  JsonWriter(escaped, {.forTerminal = true}).raw(replaceInvalidUtf8(row.payload));
+  return out + laidOut(escaped) + "\n";
+}
+
+// The fields of a row for other programs. The payload is the last and the only one of any length.
+std::string rowFields(const SpooledEvent& row, const Terminal& terminal) {
+  return fieldsLine({std::to_string(row.id), terminal.paint(Colour::faint, stampText(dateOf(row))),
+                     terminalText(row.name), glance(parsed(row.payload), row.payload)});
+}
+
+constexpr size_t kIdWidth = 6;
 constexpr size_t kEventWidth = 24;
 
 std::string humanLine(const SpooledEvent& row, const Terminal& terminal) {
   std::string name = shortened(shownName(row.name), kEventWidth);
   name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
-  const std::string time = dateText(Date{std::chrono::microseconds{row.time}}).substr(5);
+  const std::string time = dateText(dateOf(row)).substr(5);
+  std::string id = std::to_string(row.id);
+  id.insert(0, kIdWidth - std::min(kIdWidth, id.size()), ' ');
   // The payload gets the rest of the line, and one column at least on a narrow terminal.
-  const size_t used = time.size() + 2 + kEventWidth + 2;
+  const size_t used = id.size() + 2 + time.size() + 2 + kEventWidth + 2;
   const std::string payload = cutOff(glance(parsed(row.payload), row.payload),
                                      terminal.width - std::min(used, terminal.width - 1));
-  return terminal.paint(Colour::faint, time) + "  " + name + "  " + payload + "\n";
+  return id + "  " + terminal.paint(Colour::faint, time) + "  " + name + "  " + payload + "\n";
 }
 
 class EventsRun {
@@ -139,7 +210,26 @@ class EventsRun {
     return options_.follow ? follow() : kDone;
   }
 
+  int showRow(int64_t id) {
+    const SpoolReader::State state = spool_.open();
+    if (state != SpoolReader::State::open) return complain(state);
+    const auto row = spool_.row(id);
+    if (!row) {
+      if (spool_.failed()) return complain(SpoolReader::State::damaged);
+      return fail(kBad, "the spool holds no row " + std::to_string(id) + "; " + heldIds());
+    }
+    print(options_.json ? rowJson(*row) : wholeRow(*row, terminal_));
+    return kDone;
+  }
+
  private:
+  std::string heldIds() {
+    const auto ids = spool_.ids();
+    return ids ? "its ids go from " + std::to_string(ids->first) + " to " +
+                     std::to_string(ids->second)
+               : "it is empty";
+  }
+
   int complain(SpoolReader::State state) {
     switch (state) {
       case SpoolReader::State::absent:
@@ -164,7 +254,9 @@ class EventsRun {
     const bool limited = options_.newest != 0;
     const bool read = spool_.readNew([&](const SpooledEvent& row) {
       if (!selection_.wants(row)) return;
-      std::string line = options_.json ? rowJson(row) : humanLine(row, terminal_);
+      std::string line = options_.json           ? rowJson(row)
+                         : terminal_.interactive ? humanLine(row, terminal_)
+                                                 : rowFields(row, terminal_);
       if (!limited || followed_) {
         print(line);
         return;
@@ -176,7 +268,7 @@ class EventsRun {
     });
     for (const std::string& line : last) print(line);
     // With --follow a reader of the pipe waits for these rows. A buffer would hold them back.
-    std::fflush(stdout);
+    flushOutput();
     return read;
   }
 
@@ -200,7 +292,23 @@ class EventsRun {
   bool followed_ = false;
 };
 
+int showEvent(const EventsOptions& options, const Surroundings& surroundings) {
+  if (options.choose())
+    return fail(kUsage, "'events show' shows the row that it names; only --json goes with it");
+  int64_t id = 0;
+  const std::string& word = *options.id;
+  const char* end = word.data() + word.size();
+  const auto [stop, error] = std::from_chars(word.data(), end, id);
+  if (error != std::errc() || stop != end || id < 1)
+    return fail(
+        kUsage,
+        "'" + word +
+            "' is no id; 'tesselctl events' begins each row with its id, a whole number from 1");
+  return EventsRun(options, {}, surroundings).showRow(id);
+}
+
 int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
+  if (options.id) return showEvent(options, surroundings);
   std::optional<Period> period;
   if (options.period.given()) {
     const PeriodResult result = periodOf(options.period, surroundings.now);
@@ -216,9 +324,12 @@ const CommandText kEvents{
     "events", "Show what the spool holds, newest last",
     "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event sent, "
     "in\n"
-    "order. '~' stands for 'com.vantor.performance.'. Patterns may hold * and ?.\n\n"
+    "order. On a terminal '~' stands for 'com.vantor.performance.'. In a pipe a row is one line,\n"
+    "with tabs between id, time, name and payload. Patterns may hold * and ?.\n\n"
     "Examples:\n"
     "  tesselctl events -n 20\n"
+    "  tesselctl events show 42\n"
+    "  tesselctl events | grep -c period=week\n"
     "  tesselctl events --name com.vantor.performance.tessel_reporting_stats --json\n"
     "  tesselctl events --follow --subsystem com.vantor.Calendar"};
 
@@ -239,6 +350,13 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
   command.add_option("-n,--newest", options.newest, "Only so many, the newest")->type_name("COUNT");
   command.add_flag("--follow", options.follow, "Go on with what is sent from now on");
   command.add_flag("--json", options.json, "One JSON object a line: id, time, name, payload");
+  CLI::App* show = command.add_subcommand("show", "Show one row whole, its payload laid out");
+  show->add_option("ID", options.id, "The id of the row, as 'tesselctl events' shows it")
+      ->required()
+      ->type_name("");
+  show->footer("The options are those of 'tesselctl events'; only --json and --color go with it.");
+  show->fallthrough();
+  command.require_subcommand(0, 1);
 }
 
 }  // namespace tessel::ctl

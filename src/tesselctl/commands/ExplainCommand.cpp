@@ -111,8 +111,25 @@ std::string shownKind(const TesselObject& object) {
                                                          : "event";
 }
 
-// The lines for one object: its columns, and below them the reason of the verdict. A long path
-// takes several lines.
+// One object as one line of fields. Scripts count fields from the first, so a further one must
+// stand behind the reason. Only the payload stands behind it, as the last, where it is asked for.
+std::string explanationFields(const Explanation& explanation, bool withPayload,
+                              const Terminal& terminal) {
+  const auto& [object, entry, decision, scope, payload] = explanation;
+  std::vector<std::string> fields = {
+      stampText(Date{std::chrono::microseconds{static_cast<int64_t>(entry.realtime)}}),
+      terminal.paint(verdictColour(decision.classification), verdictName(decision.classification)),
+      shownKind(object),
+      terminalText(object.subsystem().textOr("")),
+      terminalText(object.category().textOr("")),
+      terminalText(object.name().textOr("")),
+      ruleWords(decision, scope, terminal)};
+  if (withPayload) fields.push_back(payload);
+  return fieldsLine(fields);
+}
+
+// The lines for one object on a terminal: its columns, and below them the reason of the verdict. A
+// long path takes several lines.
 class HumanLines {
  public:
   HumanLines(const Terminal& terminal, const Period& period)
@@ -135,7 +152,7 @@ class HumanLines {
         padded(std::string(verdictName(decision.classification)), kVerdictWidth + 2));
     out += padded(shownKind(explanation.object), kKindWidth + 2);
     out += indented(shownPath(explanation.object), indent);
-    if (const std::string why = ruleWords(decision, explanation.scope); !why.empty()) {
+    if (const std::string why = ruleWords(decision, explanation.scope, terminal_); !why.empty()) {
       out += std::string(timeWidth(), ' ') + indented(why, timeWidth());
     }
     // The payload is not wrapped, so that it can be copied.
@@ -185,12 +202,18 @@ class ExplainRun {
     const Explanation explanation{
         object, entry, decision, judge_.downsamplingScope(object, decision),
         payloads_ && decision.shouldReport() ? payloads_->json(object) : ""};
-    if (!options_.json && tally_.traceObjects() == 1) print(lines_.heading());
-    print(options_.json ? explanationJson(explanation) : lines_.lines(explanation));
+    print(text(explanation));
+  }
+
+  std::string text(const Explanation& explanation) const {
+    if (options_.json) return explanationJson(explanation);
+    if (!terminal_.interactive) return explanationFields(explanation, options_.payload, terminal_);
+    const bool first = tally_.traceObjects() == 1;
+    return (first ? lines_.heading() : "") + lines_.lines(explanation);
   }
 
   int follow() {
-    const auto error = run_.follow(now_, [] { std::fflush(stdout); });
+    const auto error = run_.follow(now_, flushOutput);
     return error ? failToRead(*error, reading_.store) : kDone;
   }
 
@@ -202,10 +225,11 @@ class ExplainRun {
     if (options_.summary) {
       print(options_.json ? summaryJson(tally_, run_.report())
                           : summaryText(tally_, run_.report(), terminal_));
-    } else if (!options_.json) {
+    } else if (!options_.json && terminal_.interactive) {
+      // Only rows go to a pipe, so that `wc -l` counts trace objects.
       print(closingLine());
     }
-    std::fflush(stdout);
+    flushOutput();
     return warnOfUnreadFiles(run_.report().store, reading_.store);
   }
 

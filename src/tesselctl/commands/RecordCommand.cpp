@@ -130,7 +130,7 @@ int exitStatusOf(int waitStatus) {
 
 // Runs the command and returns its exit status. A key such as Ctrl-C sends its signal to the
 // command and to us. We ignore it: if we died, nobody would record the end of the interval. The
-// command would inherit the ignored signals, so it gets the defaults back.
+// command would inherit the ignored signals, SIGXFSZ among them, so it gets the defaults back.
 int runCommand(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
   arguments.reserve(command.size() + 1);
@@ -141,6 +141,7 @@ int runCommand(const std::vector<std::string>& command) {
   sigemptyset(&defaults);
   sigaddset(&defaults, SIGINT);
   sigaddset(&defaults, SIGQUIT);
+  sigaddset(&defaults, SIGXFSZ);
   posix_spawnattr_t attributes;
   posix_spawnattr_init(&attributes);
   posix_spawnattr_setsigdefault(&attributes, &defaults);

@@ -357,7 +357,7 @@ int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
     return failToRead(fileError("state directory " + directory, EACCES), directory);
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
   print(options.json ? statusJson(status) : Screen(status, surroundings.terminal).render());
-  std::fflush(stdout);
+  flushOutput();
   // The screen is printed first: facts that this user may read are worth showing. A refusal
   // outranks the verdict of good(), since another user may get another answer.
   if (status.journal.failure && status.journal.failure->code == ErrorCode::noAccess)

@@ -43,6 +43,7 @@ void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, c
   CLI::App* command = app.add_subcommand(text.name, text.description);
   command->footer(text.footer);
   command->add_flag("--json", options->json, json);
+  addColourOption(*command, invocation);
   command->require_subcommand(1);
   command->fallthrough();
   for (const auto& [name, description, take] : positions)

@@ -114,6 +114,23 @@ bool SpoolReader::readNew(const std::function<void(const SpooledEvent&)>& visit)
   return false;
 }
 
+std::optional<SpooledEvent> SpoolReader::row(int64_t id) {
+  SqliteStatement select = database_.prepare(kSelectEvents);
+  std::vector<SpooledEvent> page;
+  if (select.prepared()) page = readEvents(select, id - 1, 1, kBytesOfAPage);
+  failure_ = database_.status();
+  reason_ = path_ + ": " + failure_.reason;
+  if (page.empty() || page.front().id != id) return {};
+  return std::move(page.front());
+}
+
+std::optional<std::pair<int64_t, int64_t>> SpoolReader::ids() {
+  const auto first = database_.integer("SELECT id FROM events ORDER BY id LIMIT 1");
+  const auto last = database_.integer("SELECT id FROM events ORDER BY id DESC LIMIT 1");
+  if (!first || !last) return {};
+  return std::pair(*first, *last);
+}
+
 std::optional<SpoolContents> SpoolReader::contents() {
   const auto count = database_.integer("SELECT count(*) FROM events");
   if (!count) {

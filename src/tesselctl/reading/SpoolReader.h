@@ -11,6 +11,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include "statora/ForwarderState.h"
 #include "statora/Sqlite.h"
@@ -48,6 +49,11 @@ class SpoolReader {
   // long as it likes: the spool is read page by page and not held meanwhile. False, with a reason,
   // where the spool cannot be read.
   bool readNew(const std::function<void(const SpooledEvent&)>& visit);
+  // The row with this id. Absent if there is none, and if the spool cannot be read; then failed().
+  std::optional<SpooledEvent> row(int64_t id);
+  bool failed() const { return !failure_.ok(); }
+  // The first and the last id in the spool; absent if it is empty.
+  std::optional<std::pair<int64_t, int64_t>> ids();
   // Nothing, with a reason, where the spool cannot be read.
   std::optional<SpoolContents> contents();
 

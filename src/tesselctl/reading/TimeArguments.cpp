@@ -257,6 +257,17 @@ std::optional<Date> parseDate(std::string_view text, Date now) {
 std::string dateText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S"); }
 std::string timeOfDayText(Date date) { return formatted(date, "%H:%M:%S"); }
 
+// With the distance from UTC two stamps of the hour that repeats when summer time ends are told
+// apart.
+std::string stampText(Date date) {
+  const auto part = date - std::chrono::floor<seconds>(date);
+  std::string digits = std::to_string(part.count());
+  digits.insert(0, 6 - digits.size(), '0');
+  std::string zone = formatted(date, "%z");  // +0100
+  if (zone.size() == 5) zone.insert(3, ":");
+  return formatted(date, "%Y-%m-%dT%H:%M:%S.") + digits + zone;
+}
+
 // One or two whole units are enough to tell how long ago a run was. Up to two days are given in
 // hours: the service runs daily, so "1 day" would not say whether a run is overdue.
 std::string durationText(microseconds duration) {

@@ -27,6 +27,8 @@ std::optional<std::chrono::microseconds> parseDuration(std::string_view text);
 
 // "2026-11-22 21:45:01", local time.
 std::string dateText(Date date);
+// "2026-11-22T21:45:01.250000+01:00", local time and its distance from UTC. parseDate() reads it.
+std::string stampText(Date date);
 // "21:45:01", local time.
 std::string timeOfDayText(Date date);
 // "3 s", "5 min", "2 h 10 min", "4 days".

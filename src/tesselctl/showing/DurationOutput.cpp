@@ -43,6 +43,12 @@ std::string threeDigits(double value) {
   return {text, end.ptr};
 }
 
+// Programs sort and compare, which one unit for all values lets them do.
+std::string plainDigits(float value) {
+  char text[32];  // of a float up to 15
+  return {text, std::to_chars(text, std::end(text), value).ptr};
+}
+
 std::string shownPath(const Durations::Row& row) {
   std::string path = terminalText(row.subsystem.textOr("-")) + " / ";
   path += terminalText(row.category.textOr("-"));
@@ -96,18 +102,21 @@ std::string quantileTable(const Durations& durations, Measure measure,
   const auto rows = durations.rows(measure);
   uint64_t negative = 0;
   size_t listed = 0;
+  const size_t most = terminal.limit(kShownPoints);
   for (const Durations::Row& row : rows) {
     negative += row.negative;
-    if (row.sketch.count() == 0 || listed == kShownPoints) continue;
+    if (row.sketch.count() == 0 || listed == most) continue;
     ++listed;
-    std::vector<Table::Cell> cells = {grouped(row.sketch.count())};
-    for (const Quantile& quantile : quantiles)
-      cells.emplace_back(shown(valueOf(row.sketch, quantile)));
+    std::vector<Table::Cell> cells = {terminal.number(row.sketch.count())};
+    for (const Quantile& quantile : quantiles) {
+      const float value = valueOf(row.sketch, quantile);
+      cells.emplace_back(terminal.interactive ? shown(value) : plainDigits(value));
+    }
     cells.emplace_back(shownPath(row));
     table.add(std::move(cells));
   }
   std::string out = table.empty() ? "" : table.render(terminal, 2);
-  if (rows.size() > listed && listed == kShownPoints) {
+  if (rows.size() > listed && listed == most) {
     out += "  ... and " + grouped(rows.size() - listed) + " more trace points (--json lists all)\n";
   }
   if (const uint64_t count = durations.notListed(measure); count != 0)
@@ -142,8 +151,11 @@ std::string durationText(const Durations& durations, const Terminal& terminal) {
       quantileTable(durations, Measure::duration, kDurationQuantiles, secondsText, terminal),
       quantileTable(durations, Measure::frameRate, kShownFrameRates, frameRateText, terminal)};
   std::string out;
-  if (!tables[0].empty())
-    out += "\n" + terminal.paint(Colour::strong, "Durations, within 1.6 %") + "\n" + tables[0];
+  if (!tables[0].empty()) {
+    const std::string unit = terminal.interactive ? "" : " in seconds";
+    out += "\n" + terminal.paint(Colour::strong, "Durations" + unit + ", within 1.6 %") + "\n" +
+           tables[0];
+  }
   if (!tables[1].empty())
     out += "\n" + terminal.paint(Colour::strong, "Frame rates") + "\n" + tables[1];
   return out;

@@ -1,7 +1,7 @@
 // The figures of a dry run as JSON and as tables.
 //
-// JSON is for programs and complete: it lists what the tally lists. Tables are for one screen, so
-// they cut long lists and say how much they cut.
+// JSON is for programs and complete: it lists what the tally lists. On a terminal tables are for
+// one screen, so they cut long lists and say how much they cut.
 
 #include "tesselctl/showing/SummaryOutput.h"
 
@@ -29,23 +29,25 @@ std::string share(uint64_t part, uint64_t whole) {
   return std::to_string(permille / 10) + "." + std::to_string(permille % 10) + " %";
 }
 
-std::string quoted(StringRef text) {
+std::string quoted(StringRef text, const Terminal& terminal) {
   if (!text) return "none";
-  return "\"" + shortened(terminalText(text.text()), kQuotedWidth) + "\"";
+  return "\"" + shortened(terminalText(text.text()), terminal.limit(kQuotedWidth)) + "\"";
 }
 
-std::string whitelistWords(const FilterDecision& decision) {
+std::string whitelistWords(const FilterDecision& decision, const Terminal& terminal) {
   const std::string slot = "string " + std::to_string(decision.stringSlot);
-  const std::string label = decision.stringLabel ? " " + quoted(decision.stringLabel) : "";
+  const std::string label =
+      decision.stringLabel ? " " + quoted(decision.stringLabel, terminal) : "";
   // An absent value is held back too, but there is no text to quote.
   if (!decision.stringValue) return slot + label + " has no value";
-  return slot + label + " has the value " + quoted(decision.stringValue) +
+  return slot + label + " has the value " + quoted(decision.stringValue, terminal) +
          (decision.specialRule ? ", which the rule for performance logging does not know"
                                : ", which is not a known value");
 }
 
-std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string& scope) {
-  std::string words = shortened(terminalText(scope), kQuotedWidth);
+std::string downsamplingWords(const TRDownsampleEntry& entry, const std::string& scope,
+                              const Terminal& terminal) {
+  std::string words = shortened(terminalText(scope), terminal.limit(kQuotedWidth));
   // A cap of zero lets nothing through, whatever the ratio is. So we do not mention the ratio.
   if (entry.cap() == 0) return words + " is never reported";
   words += ": one in " + grouped(entry.downsampleRatio()) + ", at most " + grouped(entry.cap()) +
@@ -124,7 +126,7 @@ std::string verdictTable(const Tally& tally, const Terminal& terminal) {
     if (count == 0 && verdict == TesselReporterClassificationClassNotSupported) continue;
     table.add(
         {{std::string(verdictName(verdict)), count == 0 ? Colour::faint : verdictColour(verdict)},
-         grouped(count),
+         terminal.number(count),
          share(count, tally.traceObjects()),
          std::string(classificationRow(verdict).title)});
   }
@@ -135,14 +137,14 @@ std::string kindTable(const Tally& tally, const Terminal& terminal) {
   Table table({{"KIND"}, {"REPORTED", Table::Align::right}, {"NOT REPORTED", Table::Align::right}});
   for (size_t kind = 0; kind < Tally::kKinds.size(); ++kind) {
     const KindCounts& counts = tally.kinds()[kind];
-    table.add(
-        {std::string(Tally::kKinds[kind]), grouped(counts.reported), grouped(counts.unreported)});
+    table.add({std::string(Tally::kKinds[kind]), terminal.number(counts.reported),
+               terminal.number(counts.unreported)});
   }
   return table.render(terminal, 2);
 }
 
 std::string more(size_t listed, size_t all, std::string_view what) {
-  if (all <= listed) return {};
+  if (all == listed) return {};
   return "  ... and " + grouped(all - listed) + " more " + std::string(what) +
          " (--json lists all)\n";
 }
@@ -185,14 +187,15 @@ std::string pairTable(const Tally& tally, const Terminal& terminal) {
     columns.push_back({std::string(column.title), Table::Align::right});
   Table table(std::move(columns));
   const auto pairs = tally.pairs();
-  for (size_t at = 0; at < std::min(pairs.size(), kShownPairs); ++at) {
+  const size_t shown = std::min(pairs.size(), terminal.limit(kShownPairs));
+  for (size_t at = 0; at < shown; ++at) {
     std::vector<Table::Cell> row = {terminalText(pairs[at].subsystem),
                                     terminalText(pairs[at].category)};
     for (const PairColumn& column : counted)
-      row.emplace_back(grouped(column.count(pairs[at].counts)));
+      row.emplace_back(terminal.number(column.count(pairs[at].counts)));
     table.add(std::move(row));
   }
-  return table.render(terminal, 2) + more(kShownPairs, pairs.size(), "pairs");
+  return table.render(terminal, 2) + more(shown, pairs.size(), "pairs");
 }
 
 std::string missTable(const Tally& tally, const Terminal& terminal) {
@@ -201,14 +204,15 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
                {"STRING"},
                {"TRACE POINT", Table::Align::left, true}});
   const auto misses = tally.misses();
-  for (size_t at = 0; at < std::min(misses.size(), kShownMisses); ++at) {
+  const size_t shown = std::min(misses.size(), terminal.limit(kShownMisses));
+  for (size_t at = 0; at < shown; ++at) {
     const Tally::Miss& miss = misses[at];
-    table.add({grouped(miss.count), "\"" + terminalText(miss.value) + "\"",
+    table.add({terminal.number(miss.count), "\"" + terminalText(miss.value) + "\"",
                std::to_string(miss.slot),
                terminalText(miss.subsystem) + " / " + terminalText(miss.category) + " / " +
                    terminalText(miss.name)});
   }
-  std::string out = table.render(terminal, 2) + more(kShownMisses, misses.size(), "values");
+  std::string out = table.render(terminal, 2) + more(shown, misses.size(), "values");
   // The tally keeps a bounded number of values. JSON lacks the others as well, so the line does not
   // point to it.
   if (tally.missesNotListed() != 0) {
@@ -226,7 +230,7 @@ std::string unpairedTable(const AssemblyCounts& counts, const Terminal& terminal
       {counts.replacedBegins, "a begin that was replaced by a second one"},
       {counts.openIntervals, "a begin that waits for its end"}};
   for (const auto& [count, why] : rows) {
-    if (count != 0) table.add({grouped(count), why});
+    if (count != 0) table.add({terminal.number(count), why});
   }
   return table.empty() ? "" : "\n" + table.render(terminal, 2);
 }
@@ -263,16 +267,17 @@ void addRule(JsonWriter& json, const FilterDecision& decision, const std::string
   }
 }
 
-std::string ruleWords(const FilterDecision& decision, const std::string& scope) {
+std::string ruleWords(const FilterDecision& decision, const std::string& scope,
+                      const Terminal& terminal) {
   switch (decision.classification) {
     case TesselReporterClassificationFailedStringWhitelist:
-      return whitelistWords(decision);
+      return whitelistWords(decision, terminal);
     case TesselReporterClassificationDurationThreshold:
       return "its duration is " + numberText(Number{decision.durationSeconds}) + " s";
     default:
       return decision.downsampleEntry == nullptr
                  ? ""
-                 : downsamplingWords(*decision.downsampleEntry, scope);
+                 : downsamplingWords(*decision.downsampleEntry, scope, terminal);
   }
 }
 

@@ -23,8 +23,10 @@ void addVerdicts(JsonWriter& json, const VerdictCounts& counts);
 // Writes the reason of a verdict as the member "rule". Writes nothing if the verdict needs no
 // reason.
 void addRule(JsonWriter& json, const FilterDecision& decision, const std::string& scope);
-// The reason as a sentence, fit for a terminal; empty if the verdict needs none.
-std::string ruleWords(const FilterDecision& decision, const std::string& scope);
+// The reason as a sentence, fit for a terminal; empty if the verdict needs none. Texts that the
+// sentence quotes are shortened on a terminal only.
+std::string ruleWords(const FilterDecision& decision, const std::string& scope,
+                      const Terminal& terminal);
 
 // The figures as one JSON object on one line.
 std::string summaryJson(const Tally& tally, const ExtractionReport& report);

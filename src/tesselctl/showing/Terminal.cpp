@@ -2,16 +2,21 @@
 
 #include "tesselctl/showing/Terminal.h"
 
+#include <fcntl.h>
 #include <sys/ioctl.h>
 #include <unicode/uchar.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <charconv>
 #include <cmath>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <numeric>
 
+#include "os/Files.h"
 #include "platform/Invariant.h"
 #include "platform/Text.h"
 
@@ -21,6 +26,7 @@ namespace {
 
 // A narrower terminal counts as one of 40 columns: on less, tables would be all ellipses.
 constexpr size_t kNarrowest = 40;
+constexpr size_t kWidest = 9999;      // no screen is wider, so a larger $COLUMNS is a mistake
 constexpr size_t kGap = 2;            // between columns
 constexpr size_t kLeastShrunken = 8;  // columns; with fewer, the ends of a text say nothing
 constexpr size_t kBarWidth = 30;
@@ -74,12 +80,44 @@ std::string abridged(std::string_view text, size_t width, size_t tailWidth) {
   return out;
 }
 
-// Other programs take any value of $NO_COLOR for "no", but not an empty one. So do we.
-bool coloursWanted() {
-  const char* refused = std::getenv("NO_COLOR");
-  if (refused != nullptr && *refused != '\0') return false;
-  const char* kind = std::getenv("TERM");
-  return kind != nullptr && *kind != '\0' && std::string_view(kind) != "dumb";
+// Empty if the variable is not set.
+std::string_view environmentText(const char* name) {
+  const char* value = std::getenv(name);
+  return value == nullptr ? std::string_view() : value;
+}
+
+// Whether the terminal obeys escape sequences. A dumb one would show them as text.
+bool obeysSequences() {
+  const std::string_view kind = environmentText("TERM");
+  return !kind.empty() && kind != "dumb";
+}
+
+bool coloursWanted(ColourChoice choice, bool interactive) {
+  // The option comes last from the user, so it outranks the environment. Other programs take any
+  // value of $NO_COLOR for "no", but not an empty one. So do we.
+  if (choice != ColourChoice::automatic) return choice == ColourChoice::always;
+  return interactive && environmentText("NO_COLOR").empty() && obeysSequences();
+}
+
+// Columns of the terminal; 0 if nobody knows. A shell exports $COLUMNS only if its user wants so.
+size_t columnsOf(int fd) {
+  const std::string_view text = environmentText("COLUMNS");
+  size_t columns = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), columns);
+  const bool whole = error == std::errc() && end == text.data() + text.size();
+  if (whole && columns >= 1 && columns <= kWidest) return columns;
+  winsize size{};
+  return ioctl(fd, TIOCGWINSZ, &size) == 0 ? size.ws_col : 0;
+}
+
+// The reader of a pipe may leave early, as `head` does. He has what he wanted, so we say nothing.
+// _Exit() keeps exit() from writing the rest of the buffer once more.
+[[noreturn]] void endBecauseOfOutput(int error) {
+  if (error != EPIPE) {
+    const std::string line = "tesselctl: standard output: " + errorWords(error) + "\n";
+    std::fwrite(line.data(), 1, line.size(), stderr);
+  }
+  std::_Exit(1);
 }
 
 // Colours by their place in the terminal's palette, not by value: whoever set up the terminal chose
@@ -119,16 +157,27 @@ std::string Terminal::paint(Colour colour, std::string_view text) const {
   return std::string(sequenceOf(colour)).append(text).append("\x1b[0m");
 }
 
-Terminal terminalBehind(int fd) {
+std::string Terminal::number(uint64_t number) const {
+  return interactive ? grouped(number) : std::to_string(number);
+}
+
+Terminal terminalBehind(int fd, ColourChoice choice) {
+  constexpr size_t kUsual = 80;  // of a terminal that does not know its size, such as a serial line
   Terminal terminal;
   terminal.interactive = isatty(fd) == 1;
-  if (!terminal.interactive) return terminal;
-  terminal.colours = coloursWanted();
-  winsize size{};
-  if (ioctl(fd, TIOCGWINSZ, &size) == 0 && size.ws_col != 0) {
-    terminal.width = std::max<size_t>(size.ws_col, kNarrowest);
+  terminal.colours = coloursWanted(choice, terminal.interactive);
+  if (terminal.interactive) {
+    const size_t columns = columnsOf(fd);
+    terminal.width = columns == 0 ? kUsual : std::max(columns, kNarrowest);
   }
   return terminal;
+}
+
+std::string fieldsLine(const std::vector<std::string>& fields) {
+  std::string line;
+  for (const std::string& field : fields) line.append(field).append("\t");
+  line.back() = '\n';
+  return line;
 }
 
 // Most texts are ASCII and need no tables; a table measures each of its cells.
@@ -177,7 +226,22 @@ void Table::add(std::vector<Cell> row) {
   rows_.push_back(std::move(row));
 }
 
+// Without a terminal nobody sees columns. Padding to the longest cell of a row of names would cost
+// a program kilobytes in each line, and spaces do not tell it where a field ends.
 std::string Table::render(const Terminal& terminal, size_t indent) const {
+  if (terminal.interactive) return renderAligned(terminal, indent);
+  std::vector<std::string> fields;
+  for (const Column& column : columns_) fields.push_back(column.title);
+  std::string out = fieldsLine(fields);
+  for (const auto& row : rows_) {
+    fields.clear();
+    for (const Cell& cell : row) fields.push_back(terminal.paint(cell.colour, cell.text));
+    out += fieldsLine(fields);
+  }
+  return out;
+}
+
+std::string Table::renderAligned(const Terminal& terminal, size_t indent) const {
   const std::vector<size_t> wide = widths(terminal.width - std::min(indent, terminal.width));
   const auto line = [&](auto&& cellAt) {
     std::string out(indent, ' ');
@@ -229,15 +293,28 @@ std::string wrappedBeside(std::string_view text, size_t width, size_t indent) {
   return wrappedBehind(indent, text, std::max(width, indent + 12), indent);
 }
 
-// The reader of a pipe may leave early, as `head` does. Nobody is left to read the rest, so the
-// process ends at once and does not flush its buffer.
+// A shell may start us with a standard descriptor closed (`>&-`). The next file that we open would
+// take its number, and our output would go into that file. So we fill the gap with a file that
+// refuses to be written. Writing beyond RLIMIT_FSIZE kills a process unless it ignores SIGXFSZ;
+// ignored, it is an error like any other, which we can name.
+void prepareOutput() {
+  for (const int fd : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) {
+    if (::fcntl(fd, F_GETFD) < 0) ::open("/dev/null", O_RDONLY);
+  }
+  std::signal(SIGXFSZ, SIG_IGN);
+}
+
 void print(std::string_view text) {
-  if (std::fwrite(text.data(), 1, text.size(), stdout) != text.size()) std::_Exit(1);
+  if (std::fwrite(text.data(), 1, text.size(), stdout) != text.size()) endBecauseOfOutput(errno);
+}
+
+void flushOutput() {
+  if (std::fflush(stdout) != 0) endBecauseOfOutput(errno);
 }
 
 // Standard output is flushed first: both may be the same terminal, where order matters.
 void printError(std::string_view text) {
-  std::fflush(stdout);
+  flushOutput();
   std::fwrite(text.data(), 1, text.size(), stderr);
 }
 
@@ -247,7 +324,7 @@ ProgressBar::ProgressBar(bool wanted)
       nextLook_(std::chrono::steady_clock::now() + kPatience) {}
 
 void ProgressBar::update(double part, uint64_t entries) {
-  if (!wanted_ || !terminal_.interactive) return;
+  if (!wanted_ || !terminal_.interactive || !obeysSequences()) return;
   const auto now = std::chrono::steady_clock::now();
   if (now < nextLook_) return;
   nextLook_ = now + kRedrawInterval;

@@ -1,13 +1,18 @@
-// The terminal: how wide it is, whether it takes colours, and how columns, paragraphs, lines of
-// JSON and the progress of long work are laid out on it.
+// Standard output, as a terminal or as lines for other programs.
 //
-// Texts must be fit for a terminal already (see platform/Text.h): what is laid out here is measured
-// and cut, never escaped. One thread at a time.
+// A terminal gets aligned columns that fit its width. Where there is no terminal, `grep`, `cut` and
+// `sort` read the output. So a row is one line there, its fields stand between tabs, numbers are
+// plain digits, and nothing is cut or wrapped.
+//
+// Texts must be fit for a terminal already (see platform/Text.h): they are measured and cut here,
+// never escaped. Escaped text holds no tab and no line feed, so the tabs and line feeds of a line
+// are always ours. One thread at a time.
 
 #pragma once
 
 #include <chrono>
 #include <cstdint>
+#include <limits>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -19,17 +24,30 @@ namespace tessel::ctl {
 enum class Colour { plain, good, bad, caution, faint, strong };
 
 struct Terminal {
+  // The width of a line that nobody has to fit on a screen.
+  static constexpr size_t kUnlimited = std::numeric_limits<size_t>::max();
+
   bool interactive = false;  // a terminal, not a file or a pipe
   bool colours = false;
-  size_t width = 80;  // columns
+  size_t width = kUnlimited;  // columns
 
   // `text` in `colour`, or plain if colours are not wanted.
   std::string paint(Colour colour, std::string_view text) const;
+  // A number in a row: "1,234" on a terminal, else "1234", which programs can sort and add up.
+  std::string number(uint64_t number) const;
+  // `columns` on a terminal. Elsewhere no limit, since nothing is cut there.
+  size_t limit(size_t columns) const { return interactive ? columns : kUnlimited; }
 };
 
-// What stands behind a file descriptor. A terminal gets colours, unless $NO_COLOR is set and not
-// empty, or $TERM is "dumb". Files and pipes are 80 columns wide.
-Terminal terminalBehind(int fd);
+enum class ColourChoice { automatic, always, never };
+
+// What stands behind a file descriptor. A terminal is as wide as $COLUMNS says, or else as it says
+// itself. Other values of $COLUMNS than whole numbers from 1 to 9999 are ignored. `automatic` gives
+// colours to a terminal, unless $NO_COLOR is set and not empty, or $TERM is "dumb" or absent.
+Terminal terminalBehind(int fd, ColourChoice choice = ColourChoice::automatic);
+
+// The fields of a row with tabs between them and a line feed behind them. REQUIRES: a field.
+std::string fieldsLine(const std::vector<std::string>& fields);
 
 // Columns that `text` takes.
 size_t displayWidth(std::string_view text);
@@ -39,7 +57,7 @@ std::string shortened(std::string_view text, size_t width);
 // The same, but a text that is too long loses its end.
 std::string cutOff(std::string_view text, size_t width);
 
-// Rows in aligned columns.
+// Rows in aligned columns, or with tabs between where there is no terminal.
 class Table {
  public:
   enum class Align { left, right };
@@ -60,10 +78,11 @@ class Table {
   // REQUIRES: as many cells as there are columns.
   void add(std::vector<Cell> row);
   bool empty() const { return rows_.empty(); }
-  // Titles and rows. Each line ends with a line feed and begins with `indent` spaces.
+  // Titles and rows. Each line ends with a line feed. On a terminal it begins with `indent` spaces.
   std::string render(const Terminal& terminal, size_t indent = 0) const;
 
  private:
+  std::string renderAligned(const Terminal& terminal, size_t indent) const;
   std::vector<size_t> widths(size_t available) const;
 
   const std::vector<Column> columns_;
@@ -86,12 +105,18 @@ std::string objectLine(Write&& write) {
   return line + "\n";
 }
 
-// Writes all of `text` to standard output. Ends the process if nobody reads it any more.
+// Makes standard output fit to report its errors. Called once, before anything is opened.
+void prepareOutput();
+// Both end the process if standard output takes no more: with a line on stderr and status 1, or
+// without a word if the reader of a pipe left. Whoever prints must have nothing left to tidy up.
+// print() may keep the text in a buffer; flushOutput() writes it.
 void print(std::string_view text);
+void flushOutput();
 void printError(std::string_view text);
 
 // ProgressBar: shows on standard error how far long work is. It appears if standard error is a
-// terminal and the work takes more than a second, and is gone without a trace once it is destroyed.
+// terminal that can erase a line, and the work takes more than a second. It is gone without a trace
+// once it is destroyed.
 class ProgressBar {
  public:
   // `wanted` is false if something else is written to the terminal meanwhile.

@@ -27,11 +27,13 @@ TEST(TerminalTest, TablesAlignAndShrinkWhereTheyMay) {
   Table table({{"NAME", Table::Align::left, true}, {"N", Table::Align::right}, {"WHY"}});
   table.add({"com.vantor.Calendar", "7", "because"});
   table.add({"a", "1,000", ""});
-  EXPECT_EQ(table.render(Terminal{false, false, 80}, 1),
+  EXPECT_EQ(table.render(Terminal{true, false, 80}, 1),
             " NAME                     N  WHY\n com.vantor.Calendar      7  because\n a            "
             "        1,000\n");
-  EXPECT_EQ(table.render(Terminal{false, false, 28}),
+  EXPECT_EQ(table.render(Terminal{true, false, 28}),
             "NAME              N  WHY\ncom.va\u2026endar      7  because\na             1,000\n");
+  EXPECT_EQ(table.render(Terminal{}, 1),
+            "NAME\tN\tWHY\ncom.vantor.Calendar\t7\tbecause\na\t1,000\t\n");
 }
 
 TEST(TerminalTest, LinesBreakBetweenWords) {
