@@ -29,6 +29,10 @@ constexpr uint64_t kOtherValue = 1000;
 constexpr uint64_t kAllowedPerByte = 200;
 constexpr uint64_t kAllowedBytes = 500'000;
 
+// Bytes from one item of an entry to the next.
+template <typename Item>
+constexpr size_t kStep = sizeof(Item) == sizeof(uint32_t) ? kCompactEntryItemSize : kEntryItemSize;
+
 std::string_view textOf(std::span<const uint8_t> bytes) {
   return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
 }
@@ -134,10 +138,9 @@ size_t JournalEntryStream::collectTokens() {
 // They are templates, so that they need not ask for the layout in each round.
 template <typename Item>
 bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
-  constexpr size_t kStep =
-      sizeof(Item) == sizeof(uint32_t) ? kCompactEntryItemSize : kEntryItemSize;
   MarkPlaces::View places(places_);
-  for (const uint8_t *item = items, *end = items + count * kStep; item != end; item += kStep) {
+  for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
+       item += kStep<Item>) {
     const uint64_t offset = load<Item>(item);
     MarkPlaces::State state = places.at(offset);
     if (state == MarkPlaces::plain) [[likely]]
@@ -185,20 +188,21 @@ template <typename Item>
 size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
   const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
-  const size_t step = file_.itemSize();
   FieldToken* const tokens = context_.resources.tokens.data();
   FieldToken* kept = tokens;
   uint32_t hash = 0;
-  for (size_t i = 0; i < count; ++i) {
-    const uint64_t offset = load<Item>(items + i * step);
-    TokenCache::Value value{TokenCache::kUnknown, 0};
-    if (TokenCache::takes(offset)) [[likely]]
-      value = cache.find(offset);
-    if (value.token == TokenCache::kUnknown) [[unlikely]] {
+  for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
+       item += kStep<Item>) {
+    const uint64_t offset = load<Item>(item);
+    const TokenCache::Value* known = TokenCache::takes(offset) ? cache.findAtOnce(offset) : nullptr;
+    TokenCache::Value value;
+    if (known != nullptr) [[likely]] {
+      value = *known;
+    } else {
       // We look at the flag here and not for each field: only a miss reads and decompresses, which
       // can take long.
       if (stopped()) return static_cast<size_t>(kept - tokens);
-      value = newTokenAt(offset);
+      value = rememberedOrNew(offset);
     }
     *kept = value.token;
     kept += value.token != kNoToken;
@@ -210,15 +214,24 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   return static_cast<size_t>(kept - tokens);
 }
 
+// An object that was written for this entry is new, and the cache need not be asked.
+TokenCache::Value JournalEntryStream::rememberedOrNew(uint64_t offset) {
+  const uint64_t fresh = walk_.firstFresh();
+  if (!TokenCache::takes(offset) || offset - fresh < walk_.offset() - fresh)
+    return newTokenAt(offset);
+  const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
+  const TokenCache::Value* known = cache.find(offset);
+  return known != nullptr ? *known : newTokenAt(offset);
+}
+
 // The tokens of an entry that does not match its hash, without those of damaged data objects.
 template <typename Item>
 size_t JournalEntryStream::intactTokensOf(const uint8_t* items, size_t count) {
-  const size_t step = file_.itemSize();
   FieldToken* const tokens = context_.resources.tokens.data();
   size_t kept = 0;
   bool damaged = false;
   for (size_t i = 0; i < count && !stopped(); ++i) {
-    const uint64_t offset = load<Item>(items + i * step);
+    const uint64_t offset = load<Item>(items + i * kStep<Item>);
     DataObject data;
     const auto text = textAt(offset, data);
     if (!text || !file_.hashOfData(text->head, data.hash)) {
@@ -234,10 +247,7 @@ size_t JournalEntryStream::intactTokensOf(const uint8_t* items, size_t count) {
   return 0;
 }
 
-// Reads a data object and shows it to the tokenizer. The cache does not remember every token. It
-// need not remember a value that was written for this entry and says that no other has it: nobody
-// will ask for it again, and it would push out a value that recurs. It does remember every
-// compressed value: if the value's claim is wrong, decompressing it again and again would be slow.
+// Reads a data object and shows it to the tokenizer.
 TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
   DataObject data;
   const auto text = textAt(offset, data);
@@ -250,9 +260,21 @@ TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
   comparable_ = comparable_ && text->whole;
   const TokenCache::Value value{token, static_cast<uint32_t>(lookup3(text->head))};
   // The hash of a part is no hash, so such a value must be met anew each time.
-  if (text->whole && (offset < walk_.firstFresh() || data.entryCount != 1 || data.compression != 0))
-    TokenCache::OfFile(context_.resources.tokenCache, number_).store(offset, value);
+  if (text->whole && TokenCache::takes(offset)) remember(offset, data, value);
   return value;
+}
+
+// A data object counts the entries that have it. If one was written for this entry and no other has
+// it, nobody will ask for it again. But every compressed value is remembered: if its count is
+// wrong, decompressing it again and again would be slow. A wrong count costs nothing else.
+void JournalEntryStream::remember(uint64_t offset, const DataObject& data,
+                                  TokenCache::Value value) {
+  const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
+  const bool fresh = offset >= walk_.firstFresh();
+  if (fresh && data.entryCount == 2)
+    cache.storeAwaited(offset, value);
+  else if (!fresh || data.entryCount != 1 || data.compression != 0)
+    cache.storeRecurring(offset, value);
 }
 
 // The text of the data object at `offset`, whole if it is not too long to be hashed.

@@ -3,17 +3,25 @@
 // TokenCache: which token a data object of a file has, and a part of its hash.
 //
 // Without it each field of each entry would cost a read and a lookup. One cache serves all files of
-// a store, so its size does not depend on the files. It fits the processor's second-level cache; a
-// table of all data objects would not fit and would have no bound. If the cache has forgotten a
-// token, the reader reads the data object and shows it to the tokenizer again.
+// a store, so its size does not depend on the files. A table of all data objects would have no
+// bound. If the cache has forgotten a token, the reader reads the data object and shows it to the
+// tokenizer again. If the object lies far back, that costs a system call: as much as 20 entries.
 //
-// A key is made of the number of the file and the offset of the object. It selects a set of two
-// slots. A new token goes to the second slot; when it is found there, it moves to the first. Most
-// values of a journal occur once. They push out one another in the second slot, but not the values
-// that recur.
+// There are two tables, because two kinds of values are remembered for different reasons. A value
+// that recurs is asked for in nearly every entry. All such values of a day fit into a small table,
+// and the processor keeps that table near. A value that only one later entry has is mostly the id
+// of an interval. It is asked for once, and up to 65,536 other ids may come before. In one table
+// the ids would push out the values that recur, and every id would cost a look into main memory.
+//
+// Both tables are made of lines, as long as a line of the processor's cache. A stretch of the file
+// selects a line, and so neighbours in the file have neighbouring lines. A hash would spread them,
+// but ids are stored in the order of the file and asked for in nearly the same order. The line of
+// an id has several ids that come soon after it, so half of the looks into main memory are spared.
+// Each line has five slots. What was stored or found last stands first; a new value pushes out the
+// last.
 //
 // A slot must never return the token of another object: that would put a wrong value into an event.
-// So a slot also holds the tag, the part of the key that does not select the set. Set and tag
+// So a slot also holds the tag, the part of the key that does not select the line. Line and tag
 // together are the whole key: the number of the file and the offset divided by eight, because
 // objects begin at multiples of eight.
 //
@@ -36,15 +44,6 @@
 namespace tessel {
 
 class TokenCache {
- private:
-  static constexpr int kPlaceShift = 3;
-  static constexpr int kPlaceBits = 32;  // of an offset, after the shift
-  static constexpr int kFileBits = 13;
-  static constexpr int kSetBits = 15;  // 2^15 sets of 24 bytes are 768 KiB
-  static constexpr int kKeyBits = kPlaceBits + kFileBits;
-  static constexpr int kTagBits = kKeyBits - kSetBits;  // 30, so that a tag fits 32 bits
-  static constexpr size_t kSets = size_t{1} << kSetBits;
-
  public:
   struct Value {
     FieldToken token = kNoToken;
@@ -52,86 +51,138 @@ class TokenCache {
   };
 
  private:
+  static constexpr int kPlaceShift = 3;
+  static constexpr int kPlaceBits = 30;  // of an offset, after the shift
+  static constexpr int kFileBits = 13;
+  // The place of an object is its offset after the shift.
+  static uint32_t placeOf(uint64_t offset) { return static_cast<uint32_t>(offset >> kPlaceShift); }
+
+  static constexpr size_t kSlots = 5;
   struct Slot {
-    uint32_t tag;
+    uint32_t tag = 0;  // 0: empty
     Value value;
   };
-  struct Set {
-    Slot first;
-    Slot second;
+  struct alignas(64) Line {
+    Slot slots[kSlots];
   };
+
+  // 2^kLineBits lines. A line serves 2^kStretchBits neighbouring places.
+  template <int kLineBits, int kStretchBits>
+  struct Table {
+    static constexpr uint32_t kLines = uint32_t{1} << kLineBits;
+
+    std::unique_ptr<Line[]> lines = std::make_unique<Line[]>(kLines);
+
+    void clear() { std::fill_n(lines.get(), kLines, Line{}); }
+  };
+
+  template <int kLineBits, int kStretchBits>
+  class View {
+   public:
+    View(const Table<kLineBits, kStretchBits>& table, uint32_t file)
+        : lines_(table.lines.get()),
+          // A tag has no room for the whole place. The bits of it that select the line are free,
+          // and so are the two highest. They hold the number of the file, and a bit that no empty
+          // slot has.
+          file_((file & (kLines - 1)) << kStretchBits | (file >> kLineBits | kTaken) << kPlaceBits),
+          // Without it the beginnings of all files would share the same lines. The factor is 2^32
+          // divided by the golden ratio.
+          firstLine_(file * 0x9e3779b9u) {}
+
+    Slot* slotsOf(uint64_t offset) const {
+      return lines_[((placeOf(offset) >> kStretchBits) + firstLine_) & (kLines - 1)].slots;
+    }
+    uint32_t tagOf(uint64_t offset) const {
+      return (placeOf(offset) & ~((kLines - 1) << kStretchBits)) | file_;
+    }
+    // Null if nothing is remembered. What is found then stands first.
+    const Value* find(uint64_t offset) const {
+      Slot* const slots = slotsOf(offset);
+      for (Slot* slot = slots; slot != slots + kSlots; ++slot) {
+        if (slot->tag != tagOf(offset)) continue;
+        std::rotate(slots, slot, slot + 1);
+        return &slots->value;
+      }
+      return nullptr;
+    }
+    void store(uint64_t offset, Value value) const {
+      Slot* const slots = slotsOf(offset);
+      std::copy_backward(slots, slots + kSlots - 1, slots + kSlots);
+      *slots = {tagOf(offset), value};
+    }
+
+   private:
+    static constexpr uint32_t kLines = Table<kLineBits, kStretchBits>::kLines;
+    static constexpr uint32_t kTaken = 2;
+    static_assert(kFileBits <= kLineBits + 1 && kLineBits + kStretchBits <= kPlaceBits);
+
+    Line* lines_;
+    uint32_t file_;
+    uint32_t firstLine_;
+  };
+
+  // 512 KiB, for 40,960 values. A stretch has 64 bytes, so only one object begins in it: the values
+  // of one program stand beside one another and recur together, and one line could not hold them.
+  static constexpr int kRecurringLineBits = 13;
+  static constexpr int kRecurringStretchBits = 3;
+  // 1 MiB, for 81,920 values. The shortest entry with a value of its own takes some 300 bytes, so
+  // no more than four such values share a stretch of 1 KiB.
+  static constexpr int kAwaitedLineBits = 14;
+  static constexpr int kAwaitedStretchBits = 7;
 
  public:
   // Numbers of files are below this.
   static constexpr uint32_t kMaxFiles = uint32_t{1} << kFileBits;
-  // The token that find() returns if nothing is remembered. No token has this value.
-  static constexpr FieldToken kUnknown = UINT32_MAX;
   // Whether an object at `offset` can be remembered. Other offsets would have the key of another
-  // object: those behind 32 GiB, before which the daemon rotates its files, and damaged ones.
+  // object: those behind 8 GiB, before which the daemon rotates its files, and damaged ones.
   static constexpr bool takes(uint64_t offset) {
     constexpr uint64_t kMaxOffset = (uint64_t{1} << (kPlaceBits + kPlaceShift)) - 1;
     constexpr uint64_t kMisplaced = (uint64_t{1} << kPlaceShift) - 1;
     return (offset & (~kMaxOffset | kMisplaced)) == 0;
   }
 
-  TokenCache() : sets_(std::make_unique_for_overwrite<Set[]>(kSets)) { clear(); }
-
   // Forgets all tokens if they are of another generation than `generation`.
   void useGeneration(uint32_t generation) {
     if (generation == generation_) [[likely]]
       return;
     generation_ = generation;
-    clear();
+    recurring_.clear();
+    awaited_.clear();
   }
 
-  // The view of one file. Valid while the cache lives; cheap enough to make for every entry.
+  // The view of one file. Valid while the cache lives; cheap enough to make for every entry. All
+  // calls REQUIRE that the cache takes the offset. What they return is valid until the next call.
   class OfFile {
    public:
     // REQUIRES: file < kMaxFiles.
-    OfFile(TokenCache& cache, uint32_t file)
-        : sets_(cache.sets_.get()), file_(uint64_t{file} << kPlaceBits) {}
+    OfFile(const TokenCache& cache, uint32_t file)
+        : recurring_(cache.recurring_, file), awaited_(cache.awaited_, file) {}
 
-    // What is remembered of the data object at `offset`. REQUIRES: takes(offset).
-    Value find(uint64_t offset) const {
-      const uint64_t key = keyOf(offset);
-      Set& set = sets_[key >> kTagBits];
-      if (set.first.tag == tagOf(key)) [[likely]]
-        return set.first.value;
-      if (set.second.tag != tagOf(key)) return {kUnknown, 0};
-      std::swap(set.first, set.second);
-      return set.first.value;
+    // What is remembered of the data object at `offset`, if a single look finds it; or null. For
+    // nearly every field of an entry that is enough.
+    const Value* findAtOnce(uint64_t offset) const {
+      const Slot& slot = *recurring_.slotsOf(offset);
+      return slot.tag == recurring_.tagOf(offset) ? &slot.value : nullptr;
     }
-    void store(uint64_t offset, Value value) {
-      if (!takes(offset)) return;
-      const uint64_t key = keyOf(offset);
-      Set& set = sets_[key >> kTagBits];
-      (set.first.tag == tagOf(key) ? set.first : set.second) = {tagOf(key), value};
+    // What is remembered, or null.
+    const Value* find(uint64_t offset) const {
+      const Value* known = recurring_.find(offset);
+      return known != nullptr ? known : awaited_.find(offset);
     }
+    // Both REQUIRE that nothing is remembered.
+    void storeRecurring(uint64_t offset, Value value) const { recurring_.store(offset, value); }
+    // For a value that only one later entry has.
+    void storeAwaited(uint64_t offset, Value value) const { awaited_.store(offset, value); }
 
    private:
-    // Multiplying by an odd number modulo a power of two loses nothing, and spreads neighbouring
-    // objects over the sets. The number is 2^64 divided by the golden ratio.
-    uint64_t keyOf(uint64_t offset) const {
-      constexpr uint64_t kKeys = (uint64_t{1} << kKeyBits) - 1;
-      return (file_ | offset >> kPlaceShift) * 0x9e3779b97f4a7c15u & kKeys;
-    }
-    static uint32_t tagOf(uint64_t key) {
-      return static_cast<uint32_t>(key & ((uint64_t{1} << kTagBits) - 1));
-    }
-
-    Set* sets_;
-    uint64_t file_;
+    View<kRecurringLineBits, kRecurringStretchBits> recurring_;
+    View<kAwaitedLineBits, kAwaitedStretchBits> awaited_;
   };
 
  private:
-  // An empty slot has a tag too, 0, so it answers kUnknown for the key that has this tag.
-  void clear() {
-    const Slot empty{0, {kUnknown, 0}};
-    std::fill_n(sets_.get(), kSets, Set{empty, empty});
-  }
-
   uint32_t generation_ = 0;
-  const std::unique_ptr<Set[]> sets_;
+  Table<kRecurringLineBits, kRecurringStretchBits> recurring_;
+  Table<kAwaitedLineBits, kAwaitedStretchBits> awaited_;
 };
 
 // The data objects of one file. Data objects are longer than 64 bytes, so each has a place of its
