@@ -4,16 +4,33 @@
  * entry of the system journal and is sent as one datagram to the journal's socket. From
  * TESSEL_BUFFER_SIZE bytes on it travels in a sealed memory file instead.
  *
- * Every function returns 0 or an errno value, leaves errno alone and never waits:
- *   EINVAL        subsystem or category missing or empty; a label without a value or the other way
- *                 round; a number or frame rate that is not finite; a bad attribute key
+ * Every function returns 0 or an errno value and leaves errno alone. These are mistakes of the
+ * caller, and nothing is recorded:
+ *   EINVAL        subsystem or category missing or empty
+ *   EBADMSG       a label without a value or the other way round; an attribute without a value
+ *   EDOM          a number or frame rate that is not finite
  *   EMSGSIZE      a string longer than TESSEL_VALUE_MAX bytes
- *   ENAMETOOLONG  an attribute key longer than TESSEL_KEY_MAX bytes, or a socket path too long
+ *   ENOKEY        an attribute key that is missing or empty, or holds '=' or a line feed
+ *   ENAMETOOLONG  an attribute key longer than TESSEL_KEY_MAX bytes
  *   E2BIG         more than TESSEL_ATTRIBUTES_MAX attributes
  *   ECANCELED     the end of an interval that was begun while recording was off, or ended before
- *   EAGAIN        the journal has no room just now; this trace point is lost
+ * Any other value means that the trace point is lost, and counted:
+ *   EAGAIN        the journal had no room
  *   ENOENT, ECONNREFUSED   no journal is running
- * or another errno value of the system. A program that ignores them loses trace points, never more.
+ *   or another error of the system
+ *
+ * Waiting: where the journal has no room, a call waits for it, at most 20 ms. After a wait that
+ * ended in nothing, calls wait 1 ms in each second, until a trace point is taken again. A point
+ * with no_wait never waits, and with TESSEL_TRACE_WAIT=0 in the environment no call does; another
+ * number there is the longest wait in milliseconds, up to 1000.
+ *
+ * Losses: each later trace point says how many this program has lost so far. A program that ends by
+ * exit() or by returning from main() says it once more where the number has grown since; for that
+ * it may wait up to 1 s. Nobody can know what a program lost since its last trace point that ends
+ * in another way: killed, by _exit(), by exec(). A forked child counts for itself, from zero.
+ *
+ * Mistakes are told on standard error, once for each place in the source, with TESSEL_TRACE=check
+ * in the environment when recording starts.
  *
  * Threads: any function from any thread; a token is its interval's alone. A forked child goes on
  * recording. Not for signal handlers. Strings are read during the call only. A program that closes
@@ -28,6 +45,10 @@
  */
 #ifndef TESSEL_TRACE_H
 #define TESSEL_TRACE_H
+
+#if defined(__cplusplus) ? __cplusplus < 201703L : __STDC_VERSION__ + 0 < 201112L
+#error "tessel/trace.h needs C11 or C++17: compile with -std=c11, -std=c++17 or a later standard"
+#endif
 
 #include <errno.h>
 #include <stdbool.h>
@@ -95,6 +116,7 @@ typedef struct tessel_point {
   const char* interval_id; /* pairs begin and end; absent: an id of the token's own */
   bool system_scope;       /* begin and end may come from different processes */
   bool telemetry;          /* may be reported; without it the trace point stays on the machine */
+  bool no_wait;            /* rather lost than waited for */
 } tessel_point;
 
 /* Links the end of an interval to its begin. The members are the header's own. */
@@ -103,6 +125,7 @@ typedef struct tessel_interval {
   uint64_t id;
   int error; /* what its end answers while it is not open */
   bool open;
+  bool lost; /* the begin, and the end was not counted yet */
 } tessel_interval;
 
 static inline tessel_number tessel_int(const char* label, int64_t value) {
@@ -131,182 +154,7 @@ static inline tessel_number tessel_double(const char* label, double value) {
 
 /* NOLINTBEGIN(modernize-use-nullptr): this is C as well */
 
-/* ---- How it is written: names that end in an underscore are the header's own --------------- */
-
-#if !defined(__cplusplus) && !defined(CLOCK_MONOTONIC) /* strict C11 hides both */
-#define CLOCK_MONOTONIC 1
-extern int clock_gettime(int clock, struct timespec* time);
-#endif
-
-TESSEL_INNER_ uint64_t tessel_now_ns_(void) {
-  struct timespec now;
-  clock_gettime(CLOCK_MONOTONIC, &now);
-  return (uint64_t)now.tv_sec * 1000000000u + (uint64_t)now.tv_nsec;
-}
-
-/* Decimal text of `value`, ending before `end`; answers where it begins. */
-TESSEL_INNER_ char* tessel_decimal_(char* end, uint64_t value) {
-  do {
-    *--end = (char)('0' + value % 10);
-  } while (value /= 10);
-  return end;
-}
-
-/* Text that reads back as the same double, never as an integer, in any locale. */
-TESSEL_SLOW_ void tessel_put_double_(tessel_message_* message, const char* name, double value) {
-  char text[40];
-  if (!__builtin_isfinite(value)) {
-    message->error = EINVAL;
-    return;
-  }
-  snprintf(text, sizeof text, "%.15g", value);
-  const double read_back = strtod(text, NULL);
-  if (read_back < value || read_back > value) snprintf(text, sizeof text, "%.17g", value);
-  char* point = text + strspn(text, "+-0123456789");
-  if (*point == '\0') {
-    memcpy(point, ".0", 3);
-  } else if (*point != 'e') { /* the locale's decimal point, one byte or more */
-    const char* rest = point + strcspn(point, "0123456789");
-    *point = '.';
-    memmove(point + 1, rest, strlen(rest) + 1);
-  }
-  tessel_put_field_(message, name, text, strlen(text));
-}
-
-TESSEL_INNER_ void tessel_put_integer_(tessel_message_* message, const char* name, bool negative,
-                                       uint64_t magnitude) {
-  char text[24];
-  char* const end = text + sizeof text;
-  char* begin = tessel_decimal_(end, magnitude);
-  if (negative) *--begin = '-';
-  tessel_put_field_(message, name, begin, (size_t)(end - begin));
-}
-
-/* Seconds with nine decimals. */
-TESSEL_INNER_ void tessel_put_duration_(tessel_message_* message, uint64_t nanoseconds) {
-  char text[32];
-  char* const end = text + sizeof text;
-  /* The added 1 keeps the leading zeros and gives its place to the point. */
-  char* const point = tessel_decimal_(end, nanoseconds % 1000000000u + 1000000000u);
-  *point = '.';
-  const char* begin = tessel_decimal_(point, nanoseconds / 1000000000u);
-  tessel_put_field_(message, "TESSEL_DURATION=", begin, (size_t)(end - begin));
-}
-
-TESSEL_INNER_ void tessel_put_text_(tessel_message_* message, const char* name, const char* value) {
-  if (value) tessel_put_field_(message, name, value, strlen(value));
-}
-
-TESSEL_INNER_ void tessel_put_string_(tessel_message_* message, const char* label_name,
-                                      const char* value_name, const tessel_string* string) {
-  if (!string->label != !string->value) message->error = EINVAL;
-  tessel_put_text_(message, label_name, string->label);
-  tessel_put_text_(message, value_name, string->value);
-}
-
-TESSEL_INNER_ void tessel_put_number_(tessel_message_* message, const char* label_name,
-                                      const char* value_name, const tessel_number* number) {
-  if (!number->label) return;
-  const uint64_t bits = number->value.as_unsigned;
-  const bool negative = number->kind == TESSEL_NUMBER_SIGNED && number->value.as_signed < 0;
-  tessel_put_text_(message, label_name, number->label);
-  if (number->kind == TESSEL_NUMBER_DOUBLE) {
-    tessel_put_double_(message, value_name, number->value.as_double);
-  } else {
-    tessel_put_integer_(message, value_name, negative, negative ? 0 - bits : bits);
-  }
-}
-
-TESSEL_SLOW_ void tessel_put_attribute_(tessel_message_* message, const tessel_attribute* it) {
-  char text[TESSEL_VALUE_MAX];
-  const size_t key = it->key ? strlen(it->key) : 0;
-  const size_t value = it->value ? strlen(it->value) : 0;
-  if (key == 0 || !it->value || strpbrk(it->key, "=\n")) {
-    message->error = EINVAL;
-  } else if (key > TESSEL_KEY_MAX) {
-    message->error = ENAMETOOLONG;
-  } else if (value >= sizeof text - key) {
-    message->error = EMSGSIZE;
-  } else {
-    memcpy(text, it->key, key);
-    text[key] = '=';
-    memcpy(text + key + 1, it->value, value);
-    tessel_put_field_(message, "TESSEL_ATTRIBUTE=", text, key + 1 + value);
-  }
-}
-
-/* The fields of `point`. Priority debug: the journal then counts trace points against its rate
- * limit apart from the program's own messages. */
-TESSEL_INNER_ void tessel_put_point_(tessel_message_* message, const tessel_point* point) {
-  if (!point->subsystem || !*point->subsystem || !point->category || !*point->category) {
-    message->error = EINVAL;
-    return;
-  }
-  tessel_put_text_(message, "PRIORITY=", "7");
-  tessel_put_text_(message, "TESSEL_SUBSYSTEM=", point->subsystem);
-  tessel_put_text_(message, "TESSEL_CATEGORY=", point->category);
-  tessel_put_text_(message, "TESSEL_NAME=", point->name);
-  tessel_put_text_(message, "TESSEL_TELEMETRY=", point->telemetry ? "1" : NULL);
-  tessel_put_string_(message, "TESSEL_STRING1_NAME=", "TESSEL_STRING1_VALUE=", &point->string1);
-  tessel_put_string_(message, "TESSEL_STRING2_NAME=", "TESSEL_STRING2_VALUE=", &point->string2);
-  tessel_put_number_(message, "TESSEL_NUMBER1_NAME=", "TESSEL_NUMBER1_VALUE=", &point->number1);
-  tessel_put_number_(message, "TESSEL_NUMBER2_NAME=", "TESSEL_NUMBER2_VALUE=", &point->number2);
-  if (point->attribute_count > TESSEL_ATTRIBUTES_MAX) message->error = E2BIG;
-  for (size_t i = 0; i < point->attribute_count && !message->error; ++i) {
-    tessel_put_attribute_(message, &point->attributes[i]);
-  }
-}
-
-/* What only intervals carry. `token`: null where the interval has none. */
-TESSEL_INNER_ void tessel_put_interval_(tessel_message_* message, const tessel_point* point,
-                                        const tessel_interval* token) {
-  if (point->interval_id) {
-    tessel_put_text_(message, "TESSEL_INTERVAL_ID=", point->interval_id);
-  } else if (token) {
-    tessel_put_integer_(message, "TESSEL_INTERVAL_ID=", false, token->id);
-  }
-  tessel_put_text_(message, "TESSEL_INTERVAL_SCOPE=", point->system_scope ? "system" : NULL);
-}
-
-typedef enum tessel_kind_ { TESSEL_EVENT_, TESSEL_BEGIN_, TESSEL_END_ } tessel_kind_;
-
-/* Encodes and sends one trace point. `token` and `frame_rate`: null where there is none. */
-TESSEL_SLOW_ int tessel_record_(tessel_kind_ kind, const tessel_point* point,
-                                const tessel_interval* token, const double* frame_rate) {
-  static const char* const kinds[] = {"event", "begin", "end"};
-  const int caller_errno = errno;
-  tessel_message_ message;
-  message.used = 0;
-  message.memfd = -1;
-  message.error = 0;
-  tessel_put_text_(&message, "TESSEL_KIND=", kinds[kind]);
-  tessel_put_point_(&message, point);
-  if (kind != TESSEL_EVENT_) tessel_put_interval_(&message, point, token);
-  if (kind == TESSEL_END_ && token) {
-    tessel_put_duration_(&message, tessel_now_ns_() - token->start_ns);
-  }
-  if (frame_rate) tessel_put_double_(&message, "TESSEL_FRAME_RATE=", *frame_rate);
-  const int error = message.error ? message.error : tessel_deliver_(&message);
-  if (message.memfd >= 0) close(message.memfd);
-  errno = caller_errno;
-  return error;
-}
-
-TESSEL_SLOW_ int tessel_begin_(const tessel_point* point, tessel_interval* token) {
-  token->start_ns = tessel_now_ns_();
-  token->id =
-      __atomic_add_fetch(&tessel_state_v1_.intervals, 1, __ATOMIC_RELAXED) << 40 ^ token->start_ns;
-  token->error = tessel_record_(TESSEL_BEGIN_, point, token, NULL);
-  token->open = token->error == 0;
-  return token->error;
-}
-
-TESSEL_SLOW_ int tessel_end_(tessel_interval* token, const tessel_point* point,
-                             const double* frame_rate) {
-  if (token && !token->open) return token->error ? token->error : ECANCELED;
-  if (token) token->open = false;
-  return tessel_record_(TESSEL_END_, point, token, frame_rate);
-}
+#include "trace_entry.h"
 
 /* ---- The calls ------------------------------------------------------------------------------ */
 
@@ -315,41 +163,52 @@ static inline bool tessel_enabled(void) {
 #ifdef TESSEL_TRACE_DISABLED
   return false;
 #else
-  const int mode = __atomic_load_n(&tessel_state_v1_.mode, __ATOMIC_RELAXED);
+  const int mode = __atomic_load_n(&tessel_state_v2_.mode, __ATOMIC_RELAXED);
   if (__builtin_expect(mode == TESSEL_OFF_, 0)) return false;
-  return mode == TESSEL_ON_ || tessel_resolve_mode_();
+  return mode != TESSEL_UNKNOWN_ || tessel_resolve_mode_();
 #endif
 }
 
-/* Switches recording on or off for the program, whatever the environment says. */
+/* Switches recording on or off for the program, whatever the environment says. Losses from before
+ * are told at the end of the program all the same. */
 static inline void tessel_enable(bool on) {
-  __atomic_store_n(&tessel_state_v1_.mode, on ? TESSEL_ON_ : TESSEL_OFF_, __ATOMIC_RELAXED);
+  const int mode = on ? tessel_mode_when_on_() : TESSEL_OFF_;
+  __atomic_store_n(&tessel_state_v2_.mode, mode, __ATOMIC_RELAXED);
 }
 
+#ifdef TESSEL_TRACE_DISABLED
+#define TESSEL_IF_ON_(call) (0 ? (call) : 0)
+#else
+#define TESSEL_IF_ON_(call) (tessel_enabled() ? (call) : 0)
+#endif
+
 /* Records a single event. */
-static inline int tessel_event(const tessel_point* point) {
-  return tessel_enabled() ? tessel_record_(TESSEL_EVENT_, point, NULL, NULL) : 0;
+static inline int tessel_event(const tessel_point* point TESSEL_CALLER_) {
+  return TESSEL_IF_ON_(tessel_event_(point, place));
 }
 
 /* Begins an interval and fills `token`. What is not known yet can be left to the end. */
-static inline int tessel_interval_begin(const tessel_point* point, tessel_interval* token) {
+static inline int tessel_interval_begin(const tessel_point* point,
+                                        tessel_interval* token TESSEL_CALLER_) {
   token->error = 0;
   token->open = false;
-  return tessel_enabled() ? tessel_begin_(point, token) : 0;
+  token->lost = false;
+  return TESSEL_IF_ON_(tessel_begin_(point, token, place));
 }
 
 /* Ends the interval of `token`, with the duration since its begin. `point` names the same
  * subsystem, category, name and interval_id; of the rest, what it says wins over the begin. Without
  * a token (null) it ends an interval that was begun elsewhere, and the reader takes the duration
  * from the two times. A token whose begin failed gives that error again, and nothing is sent. */
-static inline int tessel_interval_end(tessel_interval* token, const tessel_point* point) {
-  return tessel_enabled() ? tessel_end_(token, point, NULL) : 0;
+static inline int tessel_interval_end(tessel_interval* token,
+                                      const tessel_point* point TESSEL_CALLER_) {
+  return TESSEL_IF_ON_(tessel_end_(token, point, NULL, place));
 }
 
 /* As tessel_interval_end(); the interval measured an animation, at `frame_rate` frames a second. */
 static inline int tessel_animation_end(tessel_interval* token, const tessel_point* point,
-                                       double frame_rate) {
-  return tessel_enabled() ? tessel_end_(token, point, &frame_rate) : 0;
+                                       double frame_rate TESSEL_CALLER_) {
+  return TESSEL_IF_ON_(tessel_end_(token, point, &frame_rate, place));
 }
 
 /* NOLINTEND(modernize-use-nullptr) */
@@ -358,6 +217,12 @@ static inline int tessel_animation_end(tessel_interval* token, const tessel_poin
 /* An event in one expression, whose arguments cost nothing while recording is off:
  * TESSEL_EVENT(.subsystem = "com.vantor.Calendar", .category = "View", .name = "Open"); */
 #define TESSEL_EVENT(...) (tessel_enabled() ? tessel_event(&(const tessel_point){__VA_ARGS__}) : 0)
+
+/* Each call says where it stands. A name within its own macro stays a function. */
+#define tessel_event(...) tessel_event(__VA_ARGS__, TESSEL_HERE_)
+#define tessel_interval_begin(...) tessel_interval_begin(__VA_ARGS__, TESSEL_HERE_)
+#define tessel_interval_end(...) tessel_interval_end(__VA_ARGS__, TESSEL_HERE_)
+#define tessel_animation_end(...) tessel_animation_end(__VA_ARGS__, TESSEL_HERE_)
 #else
 #pragma GCC diagnostic pop
 } /* extern "C" */

@@ -1,12 +1,13 @@
-/* How trace.h speaks to the journal: one non-blocking datagram socket for the program, and messages
- * in the journal's native form. For trace.h alone; names that end in an underscore are not for
- * users.
+/* How trace.h speaks to the journal: one datagram socket for the program, messages in the journal's
+ * native form, and a bounded wait where the socket is full. For trace.h alone; names that end in an
+ * underscore are not for users.
  */
 #ifndef TESSEL_TRACE_JOURNAL_H
 #define TESSEL_TRACE_JOURNAL_H
 
 #include <errno.h>
 #include <fcntl.h>
+#include <poll.h>
 #include <stdbool.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -18,6 +19,8 @@
 #include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
+
+#include "trace_state.h"
 
 #ifndef TESSEL_JOURNAL_SOCKET
 #define TESSEL_JOURNAL_SOCKET "/run/systemd/journal/socket"
@@ -32,54 +35,55 @@ extern "C" {
 #pragma GCC diagnostic ignored "-Wzero-as-null-pointer-constant"
 #endif
 
-#define TESSEL_INNER_ static __attribute__((unused))
-#define TESSEL_SLOW_ static __attribute__((unused, noinline))
-
 #if !defined(__cplusplus) && defined(__GLIBC__) && !defined(__USE_MISC)
 extern long syscall(long number, ...); /* strict C11 hides it */
 #endif
 
 enum {
-  TESSEL_UNKNOWN_ = 0,
-  TESSEL_ON_ = 1,
-  TESSEL_OFF_ = 2,
   /* what strict C11 hides */
   TESSEL_S_IFMT_ = 0170000,
   TESSEL_S_IFSOCK_ = 0140000,
   TESSEL_F_DUPFD_CLOEXEC_ = 1030,
   TESSEL_F_ADD_SEALS_ = 1033,
-  TESSEL_MFD_FLAGS_ = 1 | 2,        /* close on exec, allow sealing */
-  TESSEL_ALL_SEALS_ = 1 | 2 | 4 | 8 /* seal, shrink, grow, write */
+  TESSEL_MFD_FLAGS_ = 1 | 2,         /* close on exec, allow sealing */
+  TESSEL_ALL_SEALS_ = 1 | 2 | 4 | 8, /* seal, shrink, grow, write */
+  TESSEL_WAIT_DEFAULT_ = 20,         /* milliseconds */
+  TESSEL_WAIT_MAX_ = 1000,
+  /* We get what the system gives at most, usually 400 KiB: a burst of 300 points then finds room.
+   */
+  TESSEL_SEND_BUFFER_ = 8 << 20
 };
 
-/* One per program or library, however many of its files include this header. `socket` is the
- * descriptor with the low half of its inode number above it; 0: none. */
-struct tessel_state_v1_ {
-  uint64_t socket;
-  uint64_t intervals;
-  int mode;
-};
-extern struct tessel_state_v1_ tessel_state_v1_;
-/* NOLINTNEXTLINE(misc-definitions-in-headers): weak */
-__attribute__((weak, visibility("hidden"))) struct tessel_state_v1_ tessel_state_v1_ = {0, 0, 0};
-
-/* A datagram in the making. `memfd` holds what went before the buffer; -1 while nothing did. */
+/* A datagram in the making. A mistake of the caller and an error of the system are kept apart: only
+ * the second makes the point a lost one. */
 typedef struct tessel_message_ {
   size_t used;
-  int memfd;
+  int memfd; /* holds what went before the buffer; -1 while nothing did */
   int error;
+  int refused;       /* 0: no mistake; of several the first */
+  const char* words; /* of the mistake: the whole text, or the name of the part that is too long */
+  size_t size;       /* of that part; else 0 */
+  size_t limit;
   char bytes[TESSEL_BUFFER_SIZE];
 } tessel_message_;
 
-/* Asks the environment, once. */
-TESSEL_SLOW_ bool tessel_resolve_mode_(void) {
-  const char* value = getenv("TESSEL_TRACE");
-  const int mode = value && strcmp(value, "0") == 0 ? TESSEL_OFF_ : TESSEL_ON_;
-  int before = TESSEL_UNKNOWN_;
-  const bool first = __atomic_compare_exchange_n(&tessel_state_v1_.mode, &before, mode, false,
-                                                 __ATOMIC_RELAXED, __ATOMIC_RELAXED);
-  return (first ? mode : before) == TESSEL_ON_;
+TESSEL_INNER_ void tessel_start_(tessel_message_* message) {
+  message->used = 0;
+  message->memfd = -1;
+  message->error = 0;
+  message->refused = 0;
 }
+
+TESSEL_SLOW_ void tessel_refuse_(tessel_message_* message, int error, const char* words,
+                                 size_t size, size_t limit) {
+  if (message->refused) return;
+  message->refused = error;
+  message->words = words;
+  message->size = size;
+  message->limit = limit;
+}
+
+/* ---- The socket ----------------------------------------------------------------------------- */
 
 /* Connecting anew moves a socket to a journal that was restarted; no descriptor changes hands. */
 TESSEL_SLOW_ int tessel_connect_(int fd) {
@@ -87,7 +91,7 @@ TESSEL_SLOW_ int tessel_connect_(int fd) {
   const char* path = getauxval(AT_SECURE) ? "" : getenv("TESSEL_JOURNAL_SOCKET");
   if (!path || !*path) path = TESSEL_JOURNAL_SOCKET;
   const size_t length = strlen(path);
-  if (length >= sizeof address.sun_path) return ENAMETOOLONG;
+  if (length >= sizeof address.sun_path) return EADDRNOTAVAIL;
   memset(&address, 0, sizeof address);
   address.sun_family = AF_UNIX;
   memcpy(address.sun_path, path, length);
@@ -97,6 +101,7 @@ TESSEL_SLOW_ int tessel_connect_(int fd) {
 /* A new socket, away from the numbers of the standard streams. */
 TESSEL_SLOW_ int tessel_open_(uint64_t* handle) {
   struct stat status;
+  const int room = TESSEL_SEND_BUFFER_;
   int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   if (fd >= 0 && fd <= 2) {
     const int low = fd;
@@ -104,6 +109,7 @@ TESSEL_SLOW_ int tessel_open_(uint64_t* handle) {
     close(low);
   }
   if (fd < 0) return errno;
+  setsockopt(fd, SOL_SOCKET, SO_SNDBUF, &room, sizeof room); /* without it a burst waits earlier */
   int error = tessel_connect_(fd);
   if (!error && fstat(fd, &status) != 0) error = errno;
   if (error) {
@@ -124,12 +130,12 @@ TESSEL_INNER_ bool tessel_is_ours_(uint64_t handle) {
 
 /* The socket, opened on first use; of two threads that open it one yields. */
 TESSEL_INNER_ int tessel_socket_(int* fd) {
-  uint64_t handle = __atomic_load_n(&tessel_state_v1_.socket, __ATOMIC_ACQUIRE);
+  uint64_t handle = __atomic_load_n(&tessel_state_v2_.socket, __ATOMIC_ACQUIRE);
   if (!tessel_is_ours_(handle)) {
     uint64_t fresh = 0;
     const int error = tessel_open_(&fresh);
     if (error) return error;
-    if (__atomic_compare_exchange_n(&tessel_state_v1_.socket, &handle, fresh, false,
+    if (__atomic_compare_exchange_n(&tessel_state_v2_.socket, &handle, fresh, false,
                                     __ATOMIC_ACQ_REL, __ATOMIC_ACQUIRE)) {
       handle = fresh;
     } else {
@@ -139,6 +145,8 @@ TESSEL_INNER_ int tessel_socket_(int* fd) {
   *fd = (int)(uint32_t)handle;
   return 0;
 }
+
+/* ---- The message ---------------------------------------------------------------------------- */
 
 /* Moves the buffer into the memory file. */
 TESSEL_SLOW_ void tessel_spill_(tessel_message_* message) {
@@ -169,7 +177,7 @@ TESSEL_INNER_ void tessel_put_(tessel_message_* message, const char* bytes, size
 static inline void tessel_put_field_(tessel_message_* message, const char* name, const char* value,
                                      size_t size) {
   if (size > TESSEL_VALUE_MAX) {
-    message->error = EMSGSIZE;
+    tessel_refuse_(message, EMSGSIZE, name, size, TESSEL_VALUE_MAX);
     return;
   }
   if (memchr(value, '\n', size)) {
@@ -183,6 +191,33 @@ static inline void tessel_put_field_(tessel_message_* message, const char* name,
   tessel_put_(message, value, size);
   tessel_put_(message, "\n", 1);
 }
+
+/* Decimal text of `value`, ending before `end`; answers where it begins. */
+TESSEL_INNER_ char* tessel_decimal_(char* end, uint64_t value) {
+  do {
+    *--end = (char)('0' + value % 10);
+  } while (value /= 10);
+  return end;
+}
+
+TESSEL_INNER_ void tessel_put_integer_(tessel_message_* message, const char* name, bool negative,
+                                       uint64_t magnitude) {
+  char text[24];
+  char* const end = text + sizeof text;
+  char* begin = tessel_decimal_(end, magnitude);
+  if (negative) *--begin = '-';
+  tessel_put_field_(message, name, begin, (size_t)(end - begin));
+}
+
+/* Adds the two fields that tell `total`, a word of tessel_total_() that is not 0. */
+TESSEL_SLOW_ void tessel_put_losses_(tessel_message_* message, uint64_t total) {
+  const uint64_t since = __atomic_load_n(&tessel_state_v2_.since, __ATOMIC_RELAXED);
+  tessel_put_integer_(message, "TESSEL_LOST=", false,
+                      total & (((uint64_t)1 << TESSEL_COUNT_BITS_) - 1));
+  tessel_put_integer_(message, "TESSEL_LOST_SINCE=", false, since >> TESSEL_SINCE_BITS_);
+}
+
+/* ---- Sending -------------------------------------------------------------------------------- */
 
 /* Hands over the memory file, which nothing can change any more: the journal asks for that. */
 TESSEL_SLOW_ ssize_t tessel_send_file_(int fd, int memfd) {
@@ -210,14 +245,12 @@ TESSEL_INNER_ int tessel_send_(int fd, const tessel_message_* message) {
   return sent < 0 ? errno : 0;
 }
 
-/* Sends what the message holds, to the journal's successor where it was restarted, and as a memory
- * file where the system's datagrams are smaller than the buffer. */
-TESSEL_INNER_ int tessel_deliver_(tessel_message_* message) {
+/* One attempt. It sends to the journal's successor where it was restarted, and as a memory file
+ * where the system's datagrams are smaller than the buffer. */
+TESSEL_INNER_ int tessel_offer_(tessel_message_* message) {
   int fd = -1;
   int error = tessel_socket_(&fd);
   if (error) return error;
-  if (message->memfd >= 0) tessel_spill_(message);
-  if (message->error) return message->error;
   error = tessel_send_(fd, message);
   if (error == ECONNREFUSED || error == ENOTCONN || error == ECONNRESET) {
     error = tessel_connect_(fd);
@@ -229,6 +262,109 @@ TESSEL_INNER_ int tessel_deliver_(tessel_message_* message) {
   }
   return error;
 }
+
+/* Whether room may come by waiting. The second: more memory files are under way than the process
+ * may have descriptors. */
+TESSEL_INNER_ bool tessel_is_full_(int error) { return error == EAGAIN || error == ETOOMANYREFS; }
+
+/* The longest wait of a call, in milliseconds. */
+TESSEL_SLOW_ int tessel_wait_limit_(void) {
+  int wait = __atomic_load_n(&tessel_state_v2_.wait, __ATOMIC_RELAXED);
+  if (wait == 0) {
+    const char* const text = getenv("TESSEL_TRACE_WAIT");
+    const size_t digits = text ? strspn(text, "0123456789") : 0;
+    int limit = TESSEL_WAIT_DEFAULT_;
+    if (digits != 0 && text[digits] == '\0') {
+      const unsigned long given = strtoul(text, NULL, 10); /* too many digits: the greatest */
+      limit = given < TESSEL_WAIT_MAX_ ? (int)given : TESSEL_WAIT_MAX_;
+    }
+    wait = limit + 1;
+    __atomic_store_n(&tessel_state_v2_.wait, wait, __ATOMIC_RELAXED);
+  }
+  return wait - 1;
+}
+
+/* Offers the message again and again, for at most `limit` nanoseconds. The socket reports room for
+ * each single datagram that the daemon takes. To wake up for each would cost more than to send it.
+ * So we nap while the daemon takes some twenty, and ask the socket only where that did not help. */
+TESSEL_SLOW_ int tessel_offer_within_(tessel_message_* message, int error, uint64_t limit) {
+  const struct timespec nap = {0, 200000};
+  const uint64_t start = tessel_now_ns_();
+  uint64_t spent = 0;
+  for (bool ask = false; tessel_is_full_(error) && spent < limit; ask = error == EAGAIN) {
+    struct pollfd room = {-1, POLLOUT, 0};
+    /* Looked for each time: the program may have closed it while we waited. */
+    const int missing = ask ? tessel_socket_(&room.fd) : 0;
+    if (missing) return missing;
+    if (ask) poll(&room, 1, (int)((limit - spent + 999999u) / 1000000u));
+    nanosleep(&nap, NULL);
+    error = tessel_offer_(message);
+    spent = tessel_now_ns_() - start;
+  }
+  return error;
+}
+
+/* Waits for room. After a wait that ended without any, the daemon takes nothing, and programs must
+ * not stand still for it: then a call waits a thousandth of the time since that wait began. Who
+ * takes this time sets the beginning anew, so it is taken once however many threads record. */
+TESSEL_SLOW_ int tessel_wait_(tessel_message_* message, int error) {
+  uint64_t limit = (uint64_t)tessel_wait_limit_() * 1000000u;
+  uint64_t stuck = __atomic_load_n(&tessel_state_v2_.stuck, __ATOMIC_RELAXED);
+  const uint64_t now = tessel_now_ns_();
+  if (limit == 0) return error;
+  if (stuck) {
+    const uint64_t earned = (now - stuck) / 1000u;
+    if (earned < limit) limit = earned;
+    if (limit < 1000000u ||
+        !__atomic_compare_exchange_n(&tessel_state_v2_.stuck, &stuck, now, false, __ATOMIC_RELAXED,
+                                     __ATOMIC_RELAXED)) {
+      return error;
+    }
+  }
+  error = tessel_offer_within_(message, error, limit);
+  if (tessel_is_full_(error)) __atomic_store_n(&tessel_state_v2_.stuck, now, __ATOMIC_RELAXED);
+  return error;
+}
+
+/* Sends what the message holds. Answers 0 or why the point is lost. */
+TESSEL_INNER_ int tessel_deliver_(tessel_message_* message, bool may_wait) {
+  if (message->memfd >= 0) tessel_spill_(message);
+  if (message->error) return message->error;
+  int error = tessel_offer_(message);
+  if (__builtin_expect(tessel_is_full_(error), 0) && may_wait) error = tessel_wait_(message, error);
+  if (!error && __atomic_load_n(&tessel_state_v2_.stuck, __ATOMIC_RELAXED)) {
+    __atomic_store_n(&tessel_state_v2_.stuck, 0, __ATOMIC_RELAXED);
+  }
+  return error;
+}
+
+#ifndef TESSEL_TRACE_DISABLED
+/* The last of the program or library: at exit() and after main(), and where a library is unloaded.
+ * Its priority is the lowest that programs may use, so it comes after all destructors that may
+ * still record. Every file that includes the header asks for this call, and the first one does it
+ * all. */
+__attribute__((destructor(101), weak, visibility("hidden"))) void tessel_at_exit_v2_(void);
+/* NOLINTNEXTLINE(misc-definitions-in-headers): weak */
+void tessel_at_exit_v2_(void) {
+  /* Nothing repeats this entry, so it waits longer than a call, and where no call may wait. */
+  const uint64_t most_ns = 1000000000u;
+  const uint64_t total = tessel_total_();
+  const uint64_t told = __atomic_load_n(&tessel_state_v2_.told, __ATOMIC_RELAXED);
+  if (total != 0 && (told >> TESSEL_COUNT_BITS_ != total >> TESSEL_COUNT_BITS_ || told < total)) {
+    tessel_message_ message;
+    tessel_start_(&message);
+    tessel_put_field_(&message, "PRIORITY=", "7", 1);
+    tessel_put_losses_(&message, total);
+    int error = tessel_offer_(&message);
+    if (error) error = tessel_offer_within_(&message, error, most_ns);
+    if (!error) tessel_note_told_(total);
+    if (message.memfd >= 0) close(message.memfd);
+  }
+  /* A library that is loaded again opens a socket of its own. */
+  const uint64_t handle = __atomic_exchange_n(&tessel_state_v2_.socket, 0, __ATOMIC_ACQ_REL);
+  if (tessel_is_ours_(handle)) close((int)(uint32_t)handle);
+}
+#endif
 
 #ifdef __cplusplus
 #pragma GCC diagnostic pop

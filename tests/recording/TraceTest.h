@@ -15,8 +15,24 @@
 
 class TraceTest : public ::testing::Test {
  protected:
-  // Each test makes another journal, so a socket to the previous one must be closed.
-  void SetUp() override { closeTraceSockets(); }
+  // Each test makes another journal, so a socket to the previous one must be closed. What earlier
+  // tests lost must not stand in the entries of this one.
+  void SetUp() override {
+    closeTraceSockets();
+    tessel_state_v2_.lost = tessel_state_v2_.told = 0;
+    tessel_state_v2_.since = tessel_state_v2_.stuck = 0;
+  }
+
+  // Records until the journal has no room, without a wait, and then `further` more. Answers how
+  // many were taken.
+  size_t fill(uint64_t further = 0) {
+    tessel_point point = somePoint();
+    point.no_wait = true;
+    size_t taken = 0;
+    while (taken < 100'000 && tessel_event(&point) == 0) ++taken;
+    for (uint64_t i = 1; i < further; ++i) EXPECT_EQ(tessel_event(&point), EAGAIN);
+    return taken;
+  }
 
   static tessel_point somePoint() {
     tessel_point point{};

@@ -11,20 +11,28 @@ OPTIONS = None
 EVENTS = 300
 
 
-def journal():
-    """All entries with a TESSEL_KIND, once the daemon has written what it received."""
+def journalctl(*arguments):
+    return subprocess.run(["journalctl", "-D", "/run/log/journal", "--no-pager", *arguments],
+                          check=True, capture_output=True, text=True).stdout
+
+
+def recorded_by(*command, **environment):
+    """The entries with a TESSEL field that the command adds, once the daemon has written what it received."""
+    cursor = journalctl("-n", "0", "--show-cursor").rsplit("-- cursor: ", 1)[1].strip()
+    subprocess.run(command, check=True, stdout=subprocess.DEVNULL, env=dict(os.environ, **environment))
     subprocess.run(["journalctl", "--sync"], check=True)
-    text = subprocess.run(
-        ["journalctl", "-D", "/run/log/journal", "-o", "json", "--all", "--no-pager"],
-        check=True, capture_output=True, text=True).stdout
-    entries = [json.loads(line) for line in text.splitlines()]
-    return [entry for entry in entries if "TESSEL_KIND" in entry]
+    lines = journalctl("-o", "json", "--all", "--after-cursor", cursor).splitlines()
+    entries = [json.loads(line) for line in lines]
+    return [entry for entry in entries if "TESSEL_KIND" in entry or "TESSEL_LOST" in entry]
 
 
-def recorded_by(*command):
-    before = len(journal())
-    subprocess.run(command, check=True, stdout=subprocess.DEVNULL)
-    return journal()[before:]
+def lost_by(entries):
+    """The losses that the entries tell: of each counter the greatest total."""
+    totals = {}
+    for entry in entries:
+        counter = entry["_PID"], entry.get("TESSEL_LOST_SINCE")
+        totals[counter] = max(totals.get(counter, 0), int(entry.get("TESSEL_LOST", 0)))
+    return sum(totals.values())
 
 
 class LiveJournal(unittest.TestCase):
@@ -45,6 +53,19 @@ class LiveJournal(unittest.TestCase):
             self.assertEqual(len(filler), len("Filler=") + 3999)
         self.assertEqual(begin["TESSEL_INTERVAL_ID"], end["TESSEL_INTERVAL_ID"])
         self.assertEqual(end["TESSEL_FRAME_RATE"], "59.94")
+
+    def test_a_burst_is_in_the_journal_or_lost(self):
+        """The program records two more points while it ends."""
+        self.assertEqual(len(recorded_by(OPTIONS.burst, "1000")), 1002)
+        losses = []
+        for count, arguments, environment in ((10_000, (), {}), (10_000, (), {"TESSEL_TRACE_WAIT": "0"}),
+                                              (10_000, ("no_wait",), {}), (300, ("no_wait",), {})):
+            with self.subTest(arguments, **environment):
+                entries = recorded_by(OPTIONS.burst, str(count), *arguments, **environment)
+                points = [entry for entry in entries if "TESSEL_KIND" in entry]
+                self.assertEqual(len(points) + lost_by(entries), count + 2)
+                losses.append(lost_by(entries))
+        self.assertGreater(losses[1], 0, "a burst that never waits did not lose anything: it proves nothing")
 
     def check_example(self, *command, animation=False):
         entries = recorded_by(*command)
@@ -77,6 +98,7 @@ class LiveJournal(unittest.TestCase):
 if __name__ == "__main__":
     parser = argparse.ArgumentParser()
     parser.add_argument("--recorder", required=True)
+    parser.add_argument("--burst", required=True)
     parser.add_argument("--examples", required=True)
     parser.add_argument("--sources", required=True)
     OPTIONS, rest = parser.parse_known_args()

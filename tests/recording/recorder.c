@@ -7,13 +7,9 @@
 static int record_events(long count) {
   int sum = 0;
   for (long i = 0; i < count; ++i) {
-    int error = EAGAIN;
-    while (error == EAGAIN) {
-      error = TESSEL_EVENT(.subsystem = "com.vantor.Calendar", .category = "View", .name = "Open",
-                           .telemetry = true, .string1 = {"period", "week"},
-                           .number1 = tessel_int("index", i));
-    }
-    sum += error;
+    sum += TESSEL_EVENT(.subsystem = "com.vantor.Calendar", .category = "View", .name = "Open",
+                        .telemetry = true, .string1 = {"period", "week"},
+                        .number1 = tessel_int("index", i));
   }
   return sum;
 }

@@ -45,16 +45,6 @@ TEST_F(TraceDelivery, SurvivesTheJournal) {
   EXPECT_EQ(traceSockets().size(), 1u);
 }
 
-TEST_F(TraceDelivery, AFullJournalCostsTheTracePointAndNotTheCaller) {
-  const tessel_point point = somePoint();
-  int sent = 0;
-  int error = 0;
-  while ((error = tessel_event(&point)) == 0) ASSERT_LT(++sent, 100'000);
-  EXPECT_EQ(error, EAGAIN);
-  EXPECT_EQ(journal.take().size(), static_cast<size_t>(sent));
-  EXPECT_EQ(tessel_event(&point), 0);
-}
-
 TEST_F(TraceDelivery, WritesIntoNoDescriptorThatBecameAnothers) {
   const tessel_point point = somePoint();
   ASSERT_EQ(tessel_event(&point), 0);
@@ -78,18 +68,6 @@ TEST_F(TraceDelivery, KeepsOffTheStandardStreams) {
   EXPECT_EQ(fcntl(0, F_GETFD), -1);
   dup2(input, 0);
   close(input);
-}
-
-TEST_F(TraceDelivery, AForkedChildGoesOnRecording) {
-  const tessel_point point = somePoint();
-  ASSERT_EQ(tessel_event(&point), 0);
-  const pid_t child = fork();
-  if (child == 0) _exit(tessel_event(&point));
-  int status = -1;
-  waitpid(child, &status, 0);
-  EXPECT_EQ(status, 0);
-  EXPECT_EQ(tessel_event(&point), 0);
-  EXPECT_EQ(journal.take().size(), 3u);
 }
 
 TEST_F(TraceDelivery, ThreadsShareOneSocketAndLoseNothing) {
