@@ -8,9 +8,9 @@
 #include <array>
 
 #include "linux/RunRecordFile.h"
-#include "os/Files.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/showing/HtmlReport.h"
+#include "tesselctl/showing/OutputFile.h"
 
 namespace tessel::ctl {
 
@@ -31,14 +31,11 @@ std::string machineName() {
 }
 
 int write(const std::string& path, const std::string& page) {
-  // The web server is another user than the one who runs the report.
-  constexpr unsigned kReadableByAll = 0644;
   if (path == "-") {
     print(page);
     return kDone;
   }
-  // A web server may read the page while we replace it. It must never find half a page.
-  const auto error = replaceFileDurably(path, page, kReadableByAll);
+  const auto error = writeOutputFile(path, page);
   return error ? failToWrite(*error) : kDone;
 }
 
@@ -58,6 +55,7 @@ int makeReport(const ReportOptions& options, const Reading& reading, const Repor
 }
 
 int runReport(const ReportOptions& options, const Surroundings& surroundings) {
+  if (options.html.empty()) return fail(kUsage, "--html names no file");
   auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   ReportFacts facts{machineName(),
