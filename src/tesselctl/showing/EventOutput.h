@@ -1,0 +1,29 @@
+// A row of the spool, for people and for programs.
+//
+// Any program may have written the row, so nothing in it is trusted: what is shown is escaped, and
+// a payload need not be JSON. Stateless; any thread.
+
+#pragma once
+
+#include <string>
+
+#include "statora/ForwarderState.h"
+#include "tesselctl/showing/Terminal.h"
+
+namespace tessel::ctl {
+
+// Texts of the payload; empty where the payload has no such text.
+struct EventPath {
+  std::string subsystem;
+  std::string category;
+};
+EventPath pathOf(const SpooledEvent& row);
+
+// One JSON object on a line.
+std::string eventJson(const SpooledEvent& row);
+// One line: as wide as the terminal, or fields with tabs between.
+std::string eventLine(const SpooledEvent& row, const Terminal& terminal);
+// All of the row, its payload laid out on many lines.
+std::string wholeEvent(const SpooledEvent& row, const Terminal& terminal);
+
+}  // namespace tessel::ctl
