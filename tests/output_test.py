@@ -243,6 +243,19 @@ class Pipes(OutputTest):
                     result = self.run_to(pipe, arguments, restore_signals=False, preexec_fn=lambda: signal.signal(signal.SIGPIPE, handler))
                 self.assertEqual((result.returncode, result.stderr), (status, ""), arguments)
 
+    def test_following_ends_with_its_reader(self):
+        for arguments in (("events", "--follow"), ("explain", "--follow")):
+            reader, writer = os.pipe()
+            with open(reader, "rb") as lines, open(writer, "wb") as pipe, subprocess.Popen(
+                    [os.path.join(BIN, "tesselctl"), *arguments], env=self.machine.environment(), stdout=pipe,
+                    stderr=subprocess.PIPE) as process:
+                self.addCleanup(process.kill)
+                pipe.close()
+                if arguments[0] == "events":
+                    self.assertTrue(lines.readline())
+                lines.close()
+                self.assertEqual(process.communicate(timeout=60)[1], b"")
+
     def test_programs_tell_their_version(self):
         for program in ("tesselctl", "statora_forwarder"):
             result = self.machine.result(self.machine.start(program, "--version"))

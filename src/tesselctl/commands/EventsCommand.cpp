@@ -146,6 +146,7 @@ class EventsRun {
   int follow() {
     followed_ = true;
     for (;;) {
+      flushWhileWaiting();
       std::this_thread::sleep_for(kLookForRowsEvery);
       // A spool may go and come back: the service replaces a damaged one. A damaged spool stays
       // what it is until the next run, which may be a day away, so nobody should wait for that.

@@ -213,7 +213,7 @@ class ExplainRun {
   }
 
   int follow() {
-    const auto error = run_.follow(now_, flushOutput);
+    const auto error = run_.follow(now_, flushWhileWaiting);
     return error ? failToRead(*error, reading_.store) : kDone;
   }
 

@@ -3,6 +3,7 @@
 #include "tesselctl/showing/Terminal.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/ioctl.h>
 #include <unicode/uchar.h>
 #include <unistd.h>
@@ -310,6 +311,13 @@ void print(std::string_view text) {
 
 void flushOutput() {
   if (std::fflush(stdout) != 0) endBecauseOfOutput(errno);
+}
+
+void flushWhileWaiting() {
+  flushOutput();
+  pollfd output{STDOUT_FILENO, 0, 0};
+  if (::poll(&output, 1, 0) > 0 && (output.revents & (POLLERR | POLLHUP)) != 0)
+    endBecauseOfOutput(EPIPE);
 }
 
 // Standard output is flushed first: both may be the same terminal, where order matters.

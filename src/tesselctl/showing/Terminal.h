@@ -107,11 +107,14 @@ std::string objectLine(Write&& write) {
 
 // Makes standard output fit to report its errors. Called once, before anything is opened.
 void prepareOutput();
-// Both end the process if standard output takes no more: with a line on stderr and status 1, or
+// They end the process if standard output takes no more: with a line on stderr and status 1, or
 // without a word if the reader of a pipe left. Whoever prints must have nothing left to tidy up.
 // print() may keep the text in a buffer; flushOutput() writes it.
 void print(std::string_view text);
 void flushOutput();
+// flushOutput() for a command that waits for more to print. It also ends the process if the reader
+// of a pipe left by now: the next write would notice, but it may be hours away.
+void flushWhileWaiting();
 void printError(std::string_view text);
 
 // ProgressBar: shows on standard error how far long work is. It appears if standard error is a
