@@ -89,6 +89,13 @@ class CommandLine(unittest.TestCase):
                     (["record", "event", "s", "c", "--field", "_PID=1"], 2, "_PID"),
                     (["record", "event", "s", "c", "--field", "lower=1"], 2, "lower"),
                     (["record", "event", "s", "c", "--number1", "n=1,5"], 2, "1,5"),
+                    (["record", "event", "", "c"], 2, "TESSEL_SUBSYSTEM is empty"),
+                    (["record", "event", "s", ""], 2, "TESSEL_CATEGORY is empty"),
+                    (["record", "event", "s", "c", "--string1", "label"], 2, "LABEL=VALUE"),
+                    (["record", "event", "s", "c", "--string1", "label="], 2, "TESSEL_STRING1_VALUE is empty"),
+                    (["record", "event", "s", "c", "--number2", "=1"], 2, "TESSEL_NUMBER2_NAME is empty"),
+                    (["record", "end", "s", "c", "--attribute", "k" * 65 + "=v"], 2, "65 bytes"),
+                    (["record", "event", "s", "c", "--stdin"], 2, "--stdin"),
                     (["record", "event", "s", "c", "--duration", "1s"], 2, "1s"),
                     (["record", "end", "s", "c", "--attribute", "=v"], 2, "=v"),
                     (["record", "end", "s", "c", "--scope", "host"], 2, "scope"),
@@ -102,9 +109,44 @@ class CommandLine(unittest.TestCase):
                 result = ctl(*arguments[:at], *extra, *arguments[at:])
                 self.assertEqual(result.returncode, status, (arguments, result.stderr))
                 self.assertIn(named, result.stderr, arguments)
-        self.assertEqual(ctl("record", "event", "s", "c", "--store", "/proc/nowhere").returncode, 4)
+            missing = os.path.join(store, "missing")
+            self.assertEqual(ctl("record", "event", "s", "c", "--store", missing).returncode, 4)
+            self.assertFalse(os.path.exists(missing))
         self.assertEqual(ctl("record", "event", "s", "c", "--pid", "1").returncode, 2)
         self.assertEqual(ctl("record", "--help").returncode, 0)
+
+
+    def test_what_is_written(self):
+        """The priority that keeps trace points out of a program's own limit, and no message unless asked for."""
+        with tempfile.TemporaryDirectory() as store:
+            where = ("--store", store)
+            off = {**os.environ, "TESSEL_TRACE": "0"}
+            self.assertEqual(ctl("record", "event", "s", "c", *where, env=off).returncode, 0)
+            around = ctl("record", "--subsystem", "s", "--category", "c", *where, "--", "sh", "-c", "exit 3", env=off)
+            self.assertEqual((around.returncode, os.listdir(store)), (3, []))
+            ctl("record", "event", "s", "c", *where)
+            ctl("record", "event", "s", "c", "--message", "asked for", "--field", "PRIORITY=5", *where)
+            with open(os.path.join(store, "tessel.export"), encoding="utf-8") as file:
+                plain, asked = file.read().split("\n\n")[:2]
+            self.assertIn("\nPRIORITY=7\n", plain)
+            self.assertNotIn("MESSAGE", plain)
+            self.assertIn("\nMESSAGE=asked for\n", asked)
+            self.assertEqual(asked.count("PRIORITY=5"), asked.count("PRIORITY="))
+
+    def test_lines_of_json(self):
+        """A line that is wrong is named by its number and costs no other; what lines lack comes from the options."""
+        lines = ['{"name": "first"}', "", "nonsense", '{"nmae": "x"}', "[]", '{"name": 1}', '{"number1": {"n": 1e999}}',
+                 '{"name": "%s"}' % ("x" * (1 << 21)), '{"kind": "none"}', '{"name": "a\\u0000b"}', '{"name": "last"}']
+        with tempfile.TemporaryDirectory() as store:
+            result = ctl("record", "--stdin", "--subsystem", "s", "--category", "c", "--store", store, input="\n".join(lines))
+            with open(os.path.join(store, "tessel.export"), encoding="utf-8") as file:
+                names = [line for line in file.read().splitlines() if line.startswith("TESSEL_NAME=")]
+        self.assertEqual(names, ["TESSEL_NAME=first", "TESSEL_NAME=last"])
+        said = [line.split(": ")[1] for line in result.stderr.splitlines()]
+        self.assertEqual(said, [f"line {number}" for number in range(3, 11)] + ["8 of 10 lines were not recorded"])
+        self.assertEqual(result.returncode, 2)
+        self.assertEqual(ctl("record", "--stdin", "--", "true").returncode, 2)
+        self.assertEqual(ctl("record", "--stdin", stdin=subprocess.DEVNULL).returncode, 0)
 
 
 class Daemon(MachineTest):

@@ -164,16 +164,9 @@ TESSEL_SLOW_ int tessel_record_(tessel_kind_ kind, const tessel_point* point,
     tessel_put_duration_(&message, tessel_now_ns_() - token->start_ns);
   }
   if (frame_rate) tessel_put_frame_rate_(&message, *frame_rate);
-  const uint64_t total = tessel_total_();
-  if (__builtin_expect(total != 0, 0)) tessel_put_losses_(&message, total);
-  int error = message.refused;
-  if (!error) error = tessel_deliver_(&message, !point->no_wait);
+  const int error =
+      message.refused ? message.refused : tessel_hand_over_(&message, !point->no_wait);
   *lost = error && !message.refused;
-  if (*lost) {
-    tessel_count_lost_();
-  } else if (__builtin_expect(total != 0, 0) && !error) {
-    tessel_note_told_(total);
-  }
   if (message.memfd >= 0) close(message.memfd);
   if (__builtin_expect(tessel_checks_(), 0)) {
     tessel_check_(place, point, kind == TESSEL_EVENT_, &message, error);

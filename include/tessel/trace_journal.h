@@ -338,6 +338,20 @@ TESSEL_INNER_ int tessel_deliver_(tessel_message_* message, bool may_wait) {
   return error;
 }
 
+/* Sends the message with what was lost before it, and counts it where the socket does not take it.
+ */
+TESSEL_INNER_ int tessel_hand_over_(tessel_message_* message, bool may_wait) {
+  const uint64_t total = tessel_total_();
+  if (__builtin_expect(total != 0, 0)) tessel_put_losses_(message, total);
+  const int error = tessel_deliver_(message, may_wait);
+  if (__builtin_expect(error != 0, 0)) {
+    tessel_count_lost_();
+  } else if (__builtin_expect(total != 0, 0)) {
+    tessel_note_told_(total);
+  }
+  return error;
+}
+
 #ifndef TESSEL_TRACE_DISABLED
 /* The last of the program or library: at exit() and after main(), and where a library is unloaded.
  * Its priority is the lowest that programs may use, so it comes after all destructors that may

@@ -7,7 +7,7 @@
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
-#include <systemd/sd-journal.h>
+#include <tessel/trace.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -34,6 +34,7 @@ constexpr std::string_view kEntryEnd = "\n\n";
 // cannot tell whether entries before it are missing.
 constexpr off_t kFirstLook = off_t{64} * 1024;
 constexpr off_t kLastLook = off_t{4} * 1024 * 1024;
+constexpr size_t kPiece = TESSEL_BUFFER_SIZE;
 constexpr const char* kSocket = "/run/systemd/journal/socket";
 
 uint64_t microsecondsOf(clockid_t clock) {
@@ -151,6 +152,19 @@ std::optional<PlatformError> appendLocked(int fd, const std::string& path,
   return failure(path, "write to", error);
 }
 
+// In pieces, because a value that is not a trace point's may be longer than the buffer.
+void putBytes(tessel_message_& message, std::string_view bytes) {
+  for (; !bytes.empty(); bytes.remove_prefix(std::min(bytes.size(), kPiece))) {
+    tessel_put_(&message, bytes.data(), std::min(bytes.size(), kPiece));
+  }
+}
+
+void putField(tessel_message_& message, const RecordedField& field) {
+  std::string text;
+  appendField(text, field.name, field.value);
+  putBytes(message, text);
+}
+
 }  // namespace
 
 RecordOrigin currentOrigin() {
@@ -186,13 +200,8 @@ std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
 std::optional<PlatformError> appendToExportFile(const std::string& directory,
                                                 const RecordOrigin& origin,
                                                 const std::vector<RecordedField>& fields) {
-  std::string path = directory;
-  if (!directory.ends_with(".export")) {
-    std::error_code error;
-    std::filesystem::create_directories(directory, error);
-    if (error) return failure(directory, "make", error.value());
-    path += "/tessel.export";
-  }
+  const std::string path =
+      directory.ends_with(".export") ? directory : directory + "/tessel.export";
   const UniqueFd file(::open(path.c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
   if (!file.valid()) return failure(path, "open", errno);
   // The sequence number follows that of the last entry, so nobody else may append between our look
@@ -203,17 +212,19 @@ std::optional<PlatformError> appendToExportFile(const std::string& directory,
   return appendLocked(file.get(), path, origin, fields);
 }
 
+bool recordingEnabled() { return tessel_enabled(); }
+
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields) {
-  // The library returns success if there is no daemon, so we ask first whether its socket is there.
-  if (::access(kSocket, W_OK) != 0) return failure(kSocket, "write to the journal at", errno);
-  std::vector<std::string> texts;
-  texts.reserve(fields.size());
-  for (const RecordedField& field : fields) texts.push_back(field.name + "=" + field.value);
-  std::vector<iovec> parts;
-  parts.reserve(fields.size());
-  for (std::string& text : texts) parts.push_back({text.data(), text.size()});
-  const int result = ::sd_journal_sendv(parts.data(), static_cast<int>(parts.size()));
-  if (result < 0) return failure(kSocket, "write to the journal at", -result);
+  tessel_message_ message;
+  tessel_start_(&message);
+  for (const RecordedField& field : fields) putField(message, field);
+  const int error = tessel_hand_over_(&message, true);
+  if (message.memfd >= 0) ::close(message.memfd);
+  if (error == EAGAIN) return PlatformError{ErrorCode::failed, "the journal has no room"};
+  if (error == ENOENT || error == ECONNREFUSED) {
+    return PlatformError{ErrorCode::notFound, "no journal is running"};
+  }
+  if (error != 0) return failure(kSocket, "write to the journal at", error);
   return std::nullopt;
 }
 

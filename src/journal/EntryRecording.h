@@ -40,16 +40,21 @@ RecordOrigin currentOrigin();
 std::string exportText(const EntryHeader& header, const RecordOrigin& origin,
                        const std::vector<RecordedField>& fields);
 
-// Appends one entry to `<directory>/tessel.export` and makes both if they do not exist. If
-// `directory` ends in `.export`, it is the file itself. An error names the path and the reason.
+// Appends one entry to `<directory>/tessel.export` and makes the file if it does not exist. A
+// missing directory is an error: a misspelt path would swallow the entries. If `directory` ends in
+// `.export`, it is the file itself. An error names the path and the reason.
 // After an error nothing was appended, except when it says that half an entry could not be taken
 // back: the next append then ends that half, and readers report it as damage.
 std::optional<PlatformError> appendToExportFile(const std::string& directory,
                                                 const RecordOrigin& origin,
                                                 const std::vector<RecordedField>& fields);
 
-// Hands one entry to the journal daemon of this machine. It is an error if there is no daemon; the
-// system's own library would return success.
+// False where the environment says TESSEL_TRACE=0.
+bool recordingEnabled();
+
+// Hands one entry to the journal daemon of this machine, as a program with the recording header
+// does: the same socket for all entries, the same wait, the same count of what was lost. It is an
+// error if there is no daemon; the system's own library would return success.
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields);
 
 }  // namespace tessel

@@ -83,7 +83,7 @@ TEST_F(ExportFileTest, halfAnEntryCostsNoOther) {
 TEST_F(ExportFileTest, anErrorNamesThePathAndTheReason) {
   const auto error = appendToExportFile("/proc/nowhere", origin, {});
   ASSERT_TRUE(error);
-  EXPECT_NE(error->words.find("/proc/nowhere: No such file"), std::string::npos);
+  EXPECT_NE(error->words.find("/proc/nowhere/tessel.export: No such file"), std::string::npos);
 }
 
 }  // namespace

@@ -5,6 +5,7 @@
 
 #include <spawn.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <csignal>
@@ -14,6 +15,7 @@
 #include "journal/EntryStream.h"
 #include "os/Files.h"
 #include "tesselctl/commands/Command.h"
+#include "tesselctl/commands/RecordLines.h"
 #include "tesselctl/commands/RecordedPoint.h"
 #include "trace/TracePointFields.h"
 
@@ -34,12 +36,21 @@ constexpr const char* kFooter =
     "  tesselctl record end   com.vantor.Render Frame Draw --id 7 --frame-rate 59.9\n"
     "  tesselctl record --subsystem com.vantor.Backup --category Job -- rsync -a /home "
     "/mnt\n\n"
+    "Each line of --stdin is an object with the keys kind (without it: event), subsystem, "
+    "category,\n"
+    "name, telemetry, string1, string2, number1, number2, id, scope, duration, frame_rate,\n"
+    "attributes, fields and message:\n"
+    "  {\"subsystem\": \"com.vantor.Calendar\", \"category\": \"View\", \"name\": \"Open\",\n"
+    "   \"telemetry\": true, \"string1\": {\"period\": \"week\"}, \"number1\": {\"events\": 12}}\n"
+    "A line that cannot be recorded is named by its number, and the next one is read.\n\n"
     "A begin and its end match on subsystem, category, name and --id, and in process scope on the\n"
     "process. 'record begin' and 'record end' are two processes, so their scope is 'system' "
     "unless\n"
     "--scope says otherwise. 'record -- COMMAND' exits with the status of the command, 128 and "
     "the\n"
-    "number of the signal that killed it, 127 where it is not found.";
+    "number of the signal that killed it, 127 where it is not found.\n\n"
+    "The process that records is tesselctl itself, around a command too: reports name it, not the\n"
+    "command. TESSEL_TRACE=0 in the environment: nothing is recorded.";
 
 // The journal daemon notes who wrote an entry and when. With --store there is no daemon, so these
 // options give the facts. Without them the writer is this process and the time is now.
@@ -53,14 +64,9 @@ struct OriginOptions {
 
 struct RecordOptions {
   RecordedPoint point;
+  bool lines = false;  // --stdin
   OriginOptions origin;
   std::optional<std::string> store;
-};
-
-// An error and the exit status that goes with it. `record -- COMMAND` says it but exits otherwise.
-struct Failure {
-  ExitStatus status;
-  std::string message;
 };
 
 // The monotonic time at `realtime`. Intervals are measured with it, so it must move along with the
@@ -101,12 +107,14 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
   return origin;
 }
 
-std::optional<Failure> record(const RecordOptions& options, const std::string& kind) {
+// Absent where the point was recorded, or recording is off.
+std::optional<Failure> record(const RecordOptions& options, const RecordedPoint& point) {
+  if (!recordingEnabled()) return std::nullopt;
   if (!options.store && options.origin.any()) {
     return Failure{kUsage,
                    "--at, --ago, --monotonic, --boot, --exe, --comm and --pid need --store"};
   }
-  auto fields = fieldsOf(options.point, kind);
+  auto fields = fieldsOf(point);
   if (auto* complaint = std::get_if<std::string>(&fields)) return Failure{kUsage, *complaint};
   const auto& list = std::get<std::vector<RecordedField>>(fields);
   std::optional<PlatformError> error;
@@ -116,7 +124,9 @@ std::optional<Failure> record(const RecordOptions& options, const std::string& k
     error = appendToExportFile(*options.store, std::get<RecordOrigin>(origin), list);
   } else {
     error = sendToJournal(list);
-    if (error) error->words += " (--store DIR records without a journal)";
+    if (error && error->code == ErrorCode::notFound) {
+      error->words += " (--store DIR records without a journal)";
+    }
   }
   // Every error has this status: scripts need only know that the point was not recorded.
   if (error) return Failure{kNoAccess, error->words};
@@ -164,26 +174,36 @@ int runCommand(const std::vector<std::string>& command) {
 }
 
 int recordAround(const RecordOptions& options, const std::vector<std::string>& command) {
-  if (const auto failure = record(options, "begin")) return fail(failure->status, failure->message);
+  RecordedPoint point = options.point;
+  point.kind = "begin";
+  if (const auto failure = record(options, point)) return fail(failure->status, failure->message);
   const int status = runCommand(command);
   // The command has done its work. A script wants its status, even if we could not record the end.
-  if (const auto failure = record(options, "end")) fail(failure->status, failure->message);
+  point.kind = "end";
+  if (const auto failure = record(options, point)) fail(failure->status, failure->message);
   return status;
 }
 
-int recordPoint(RecordOptions& options, const std::string& kind) {
+int recordPoint(const RecordOptions& options, const std::string& kind) {
+  RecordedPoint point = options.point;
+  point.kind = kind;
   // `record begin` and `record end` are two processes. In process scope they would never match.
-  if (kind != "event" && !options.point.scope) options.point.scope = "system";
-  const auto failure = record(options, kind);
+  if (kind != "event" && !point.scope) point.scope = "system";
+  const auto failure = record(options, point);
   return failure ? fail(failure->status, failure->message) : kDone;
 }
 
 template <size_t N>
 void addSlotOptions(CLI::App& app, const std::string& name,
-                    std::array<std::optional<std::string>, N>& pairs, const std::string& what) {
+                    std::array<std::optional<Labelled>, N>& pairs, const std::string& what) {
   for (size_t slot = 0; slot < N; ++slot) {
+    const auto take = [&pair = pairs[slot]](const std::string& text) {
+      pair = labelledFrom(text);
+      if (!pair) throw CLI::ValidationError("'" + text + "' is not LABEL=VALUE");
+    };
     const std::string number = std::to_string(slot + 1);
-    app.add_option(name + number, pairs[slot], what + " " + number)->type_name("LABEL=VALUE");
+    app.add_option_function<std::string>(name + number, take, what + " " + number)
+        ->type_name("LABEL=VALUE");
   }
 }
 
@@ -208,15 +228,17 @@ void addPointOptions(CLI::App& app, RecordedPoint& point) {
   app.add_option("--field", point.fields, "Any other journal field; may be repeated")
       ->type_name("NAME=VALUE")
       ->allow_extra_args(false);
-  app.add_option("--message", point.message, "Text of the journal entry")->capture_default_str();
+  app.add_option("--message", point.message,
+                 "Text of the journal entry; without one 'journalctl' does not show the entry")
+      ->type_name("TEXT");
 }
 
 void addStoreOptions(CLI::App& app, RecordOptions& options) {
   const std::string group = "With --store, in place of what is true";
   OriginOptions& origin = options.origin;
   app.add_option("--store", options.store,
-                 "Append to an .export file in this directory instead of the journal; for machines "
-                 "without a journal, and for trying things out")
+                 "Append to an .export file in this directory, which must exist, instead of the "
+                 "journal; for machines without a journal, and for trying things out")
       ->type_name("DIR");
   const auto add = [&](const char* name, auto& value, const char* type, const char* help) {
     return app.add_option(name, value, help)->type_name(type)->group(group);
@@ -244,16 +266,23 @@ void addKind(CLI::App& app, Invocation& invocation, RecordOptions& options, cons
       ->required();
   command->add_option("name", options.point.name, "Name of the trace point");
   command->callback([&invocation, &options, kind] {
-    invocation.status =
-        invocation.command ? fail(kUsage, "either '" + kind + "' or a command after '--', not both")
-                           : recordPoint(options, kind);
+    const char* other = invocation.command ? "a command after '--'" : "--stdin";
+    invocation.status = invocation.command || options.lines
+                            ? fail(kUsage, "either '" + kind + "' or " + other + ", not both")
+                            : recordPoint(options, kind);
   });
 }
 
 int recordCommandLine(const CLI::App& app, const Invocation& invocation,
                       const RecordOptions& options) {
+  if (options.lines) {
+    if (invocation.command) return fail(kUsage, "either --stdin or a command after '--', not both");
+    return recordLines(STDIN_FILENO, options.point,
+                       [&](const RecordedPoint& point) { return record(options, point); });
+  }
   if (!invocation.command || invocation.command->empty()) {
-    return fail(kUsage, "record needs event, begin or end, or a command after '--'; see --help");
+    return fail(kUsage,
+                "record needs event, begin or end, --stdin, or a command after '--'; see --help");
   }
   if (app.count("--subsystem") == 0 || app.count("--category") == 0) {
     return fail(kUsage, "record around a command needs --subsystem and --category");
@@ -271,7 +300,9 @@ void addRecordCommand(CLI::App& app, Invocation& invocation) {
   addKind(*record, invocation, *options, "event", "One moment");
   addKind(*record, invocation, *options, "begin", "An interval begins");
   addKind(*record, invocation, *options, "end", "An interval ends");
-  const std::string group = "Around a command";
+  record->add_flag("--stdin", options->lines,
+                   "Record one point for each line of standard input, a JSON object");
+  const std::string group = "Around a command, or where a line of --stdin has none";
   record->add_option("--subsystem", options->point.subsystem, "Subsystem")
       ->type_name("TEXT")
       ->group(group);
