@@ -48,7 +48,7 @@
 
 #if defined(__cplusplus) ? __cplusplus < 201703L : __STDC_VERSION__ + 0 < 201112L
 #error "tessel/trace.h needs C11 or C++17: compile with -std=c11, -std=c++17 or a later standard"
-#endif
+#else /* what follows would only add errors that explain nothing */
 
 #include <errno.h>
 #include <stdbool.h>
@@ -229,4 +229,5 @@ static inline int tessel_animation_end(tessel_interval* token, const tessel_poin
 #include "trace_scope.h"
 #endif
 
+#endif
 #endif
