@@ -137,6 +137,16 @@ class Conformance(unittest.TestCase):
         self.assertEqual(len(entries), len(expected))
         self.check_ids(entries)
 
+    def test_logger(self):
+        """What writes fields to the journal without us makes the same entry, without our checks."""
+        what = CASES["every field"][0][0]
+        wanted = fields(what, "v", "logger")
+        lines = b"".join(name.encode() + b"=" + value + b"\n" for name, value in wanted)
+        logger = subprocess.Popen(["logger", "--journald"], stdin=subprocess.PIPE)
+        logger.communicate(lines)
+        entry, = journal(logger.pid)
+        self.assertEqual([field for field in read_back(entry) if field[0] != "SYSLOG_IDENTIFIER"], wanted)
+
     def test_losses(self):
         self.each(self.check_losses)
 

@@ -155,9 +155,10 @@ func say(effect, words, kind string) {
 		kind = words
 	}
 	callers := make([]uintptr, 16)
-	frames := runtime.CallersFrames(callers[:runtime.Callers(2, callers)])
+	frames := runtime.CallersFrames(callers[:runtime.Callers(1, callers)])
 	frame, more := frames.Next()
-	for more && strings.HasPrefix(frame.Function, "tessel.") {
+	own := strings.TrimSuffix(frame.Function, "say") // the package, under whatever path it is imported
+	for more && strings.HasPrefix(frame.Function, own) {
 		frame, more = frames.Next()
 	}
 	place := fmt.Sprintf("%s:%d: %s: ", filepath.Base(frame.File), frame.Line, effect)

@@ -90,8 +90,7 @@ class LiveJournal(unittest.TestCase):
                 self.assertEqual(entries[4]["TESSEL_FRAME_RATE"], "59.94")
 
     def test_the_shell_example(self):
-        entries = self.check_example(os.path.join(OPTIONS.sources, "record.sh"), PATH=OPTIONS.examples + ":/usr/bin:/bin")
-        self.assertEqual({entry["_COMM"] for entry in entries}, {"tesselctl"})
+        self.check_example(os.path.join(OPTIONS.sources, "record.sh"), PATH=OPTIONS.examples + ":/usr/bin:/bin")
 
 
 if __name__ == "__main__":

@@ -44,6 +44,7 @@ losses on standard error, once for each place in the source. Any thread may call
 """
 
 import errno
+import numbers
 import struct
 import time
 from typing import Any, Callable, Mapping, Optional, Tuple, TypeVar, Union
@@ -83,12 +84,14 @@ def _text(name: str, value: Any, words: str = "") -> bytes:
 
 def _decimal(name: str, value: Any, words: str = "") -> bytes:
     """An integer that fits 64 bits, signed or not, stays one; a float reads back as the same float."""
-    if isinstance(value, int) and not isinstance(value, bool):
+    if isinstance(value, numbers.Integral) and not isinstance(value, bool):
+        value = int(value)
         if not -(2**63) <= value < 2**64:
             raise Refused(errno.EDOM, f"{words} does not fit 64 bits")
         return field(name, b"%d" % value)
-    if not isinstance(value, float):
+    if not isinstance(value, numbers.Real) or isinstance(value, bool):
         raise Refused(errno.EDOM, f"{words} is a {type(value).__name__}, neither int nor float")
+    value = float(value)
     if value != value or value in (float("inf"), float("-inf")):
         raise Refused(errno.EDOM, f"{words} is not finite")
     text = b"%.15g" % value
@@ -102,7 +105,7 @@ def _string(name: str, value: Any, _slot: str) -> bytes:
 
 
 def _labelled(slot: str, pair: Any, encode: Callable[..., bytes]) -> bytes:
-    if not isinstance(pair, tuple) or len(pair) != 2:
+    if not isinstance(pair, (tuple, list)) or len(pair) != 2:
         raise Refused(errno.EBADMSG, f"{slot} is not (label, value)")
     if pair[0] is None or pair[1] is None:
         missing = "a value and no label" if pair[0] is None else "a label and no value"

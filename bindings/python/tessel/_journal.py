@@ -141,8 +141,10 @@ class Recorder:
             if told in self._told_places:
                 return
             self._told_places.add(told)
-        if sys.stderr is not None:
-            sys.stderr.write(f"tessel: {os.path.basename(file)}:{line}: {effect}: {words}\n")
+        try:
+            print(f"tessel: {os.path.basename(file)}:{line}: {effect}: {words}", file=sys.stderr)
+        except (OSError, ValueError):
+            pass  # nobody to tell
 
     # --- Losses and forks.
 

@@ -8,6 +8,7 @@ use crate::libc;
 use crate::message::Message;
 use std::collections::HashSet;
 use std::fs::File;
+use std::io::Write;
 use std::mem::ManuallyDrop;
 use std::os::unix::fs::{FileTypeExt, MetadataExt};
 use std::os::unix::io::{AsRawFd, FromRawFd, IntoRawFd};
@@ -168,7 +169,9 @@ pub(crate) fn flush() {
 
 /// What `check` asks for, once for each place and mistake.
 pub(crate) fn say(effect: &'static str, words: &str, kind: &str, place: &'static Location<'static>) {
-    static TOLD: Mutex<Option<HashSet<(&str, u32, &str, String)>>> = Mutex::new(None);
+    // File, line, effect, mistake.
+    type Told = HashSet<(&'static str, u32, &'static str, String)>;
+    static TOLD: Mutex<Option<Told>> = Mutex::new(None);
     if !checks() {
         return;
     }
@@ -176,7 +179,8 @@ pub(crate) fn say(effect: &'static str, words: &str, kind: &str, place: &'static
     if let Ok(mut told) = TOLD.lock() {
         if told.get_or_insert_with(HashSet::new).insert((place.file(), place.line(), effect, kind.to_string())) {
             let file = place.file().rsplit('/').next().unwrap_or("?");
-            eprintln!("tessel: {}:{}: {}: {}", file, place.line(), effect, words);
+            // Not eprintln!, which panics where nobody reads.
+            let _ = writeln!(std::io::stderr(), "tessel: {}:{}: {}: {}", file, place.line(), effect, words);
         }
     }
 }
