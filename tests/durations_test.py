@@ -84,8 +84,81 @@ class Explain(DurationsTest):
         self.assertLess(listed, 1000)
         self.assertEqual(listed + summary["durations_not_listed"], 29_040)
         text = self.machine.ctl("explain", "--summary").out
-        self.assertRegex(text, r"\n40\t0\.5\d*\t0\.5\d*\t0\.5\d*\t0\.5\tcom\.vantor\..*Draw\n")
+        self.assertTrue("\n40\t0.5\t0.5\t0.5\t0.5\tcom.vantor.Render / Frame / Draw\n" in text)
         self.assertIn(f'{summary["durations_not_listed"]:,} values of further trace points', text.replace("\u202f", ","))
+
+
+class Compare(DurationsTest):
+    LAST_WEEK = ("compare", "since=-14d,until=-7d", "last=7d")
+
+    def record_two_weeks(self, weeks):
+        """`weeks`: name to the durations of the week before last and of the last one."""
+        self.machine.write_export(sorted((entry for name, sides in weeks.items() for side, durations in enumerate(sides)
+                                          for entry in intervals(name, durations, -86_400 * (10, 3)[side])),
+                                         key=lambda entry: entry.at))
+
+    def test_what_became_slower_since_last_week_comes_first(self):
+        draw = random.Random(7)
+        some = lambda count, median, spread=0.5: [draw.lognormvariate(math.log(median), spread) for _ in range(count)]
+        weeks = {"Slower": (some(500, 0.05), some(400, 0.12)), "Tail": ([0.01] * 400, [0.01] * 360 + [0.9] * 40),
+                 "Worst": (some(40, 0.001), some(40, 1)), "Three": (some(3, 0.001), [30.0] * 3), "Same": (some(500, 0.05),) * 2,
+                 "Faster": (some(300, 0.5), some(300, 0.05)), "Gone": (some(20, 0.1), []), "New": ([], some(20, 0.1))}
+        self.record_two_weeks(weeks)
+        compared = self.json(*self.LAST_WEEK)[0]
+        self.assertEqual([(row["change"], row["name"]) for row in compared["durations"]],
+                         [("slower", "Worst"), ("slower", "Tail"), ("slower", "Slower"), ("same", "Same"), ("faster", "Faster"),
+                          ("few_values", "Three"), ("only_a", "Gone"), ("only_b", "New")])
+        for row in compared["durations"]:
+            for side, values in zip("ab", weeks[row["name"]]):
+                self.assertEqual(row[side]["count"], len(values))
+                for key in ("p50", "p95", "p99") if values else ():
+                    self.assert_near(row[side][key], quantile([round(value, 6) for value in values], int(key[1:]) / 100))
+        worst, tail, _, same, faster = compared["durations"][:5]
+        self.assertAlmostEqual(worst["factor"], worst["b"]["p50"] / worst["a"]["p50"], 3)
+        self.assertAlmostEqual(tail["factor"], tail["b"]["p95"] / tail["a"]["p95"], 3)
+        self.assertLess(faster["factor"], 0.2)
+        self.assertAlmostEqual(same["factor"], 1)
+        # A frame rate is slower where it is lower: `Worst` went from 60 to 59, `Tail` at its 5th percentile as well.
+        rates = {row["name"]: row for row in compared["frame_rates"]}
+        self.assertGreater(rates["Worst"]["factor"], 1)
+        self.assertLess(rates["Worst"]["b"]["p50"], rates["Worst"]["a"]["p50"])
+        text = self.machine.ctl(*self.LAST_WEEK).out
+        self.assertIn("3 slower, 1 same, 1 faster, 1 few values, 1 only in A, 1 only in B", text)
+
+    def test_slower_frames_are_lower_rates(self):
+        frames = lambda name, rates, at: [entry for i, rate in enumerate(rates) for entry in (
+            point("begin", "com.vantor.Render", "Frame", name, interval=f"{i}", at=at + i, mono=10**9 + i * 10**6),
+            point("end", "com.vantor.Render", "Frame", name, interval=f"{i}", at=at + i, mono=10**9 + i * 10**6 + 500, frame_rate=rate))]
+        self.machine.write_export(frames("Scroll", [60] * 200, -864_000) + frames("Spin", [60] * 200, -863_000)
+                                  + frames("Scroll", [30] * 200, -86_400) + frames("Spin", [60] * 180 + [0] * 20, -85_000))
+        rows = self.json(*self.LAST_WEEK)[0]["frame_rates"]
+        self.assertEqual([(row["change"], row["name"]) for row in rows], [("slower", "Spin"), ("slower", "Scroll")])
+        self.assertEqual((rows[1]["factor"], rows[1]["a"]["p50"], rows[1]["b"]["p50"]), (2, 60, 30))
+
+    def test_chance_makes_nothing_slower(self):
+        draw = random.Random(3)
+        self.record_two_weeks({f"N{i}": [[draw.lognormvariate(-3, 1.5) for _ in range(draw.choice((5, 20, 200)))] for _ in "ab"]
+                               for i in range(120)})
+        compared = self.json(*self.LAST_WEEK)[0]
+        self.assertEqual({row["change"] for row in compared["durations"]}, {"same", "few_values"})
+
+    def test_a_flood_in_the_second_period_makes_nothing_gone(self):
+        flood = [point("event", f"com.vantor.F{i % 40}", "A", f"N{i}", duration="1", at=-500_000 + i) for i in range(20_000)]
+        self.machine.write_export(intervals("Draw", [0.5] * 40, -900_000) + flood + intervals("Draw", [0.5] * 40, -3000))
+        compared = self.json(*self.LAST_WEEK)[0]
+        [row] = [row for row in compared["durations"] if row["change"] != "only_b"]
+        self.assertEqual((row["name"], row["change"], row["a"]["count"], row["b"]["count"]), ("Draw", "same", 40, 40))
+        listed = sum(row["b"]["count"] for row in compared["durations"])
+        self.assertEqual((listed + compared["durations_not_listed"]["b"], compared["durations_not_listed"]["a"]), (20_040, 0))
+
+    def test_a_store_younger_than_the_period_is_said_to_be(self):
+        self.machine.write_export(intervals("Draw", [0.5] * 40, -3000))
+        compared = self.json(*self.LAST_WEEK)[0]
+        self.assertEqual([compared["periods"][side]["reaches_start"] for side in "ab"], [False, False])
+        self.assertAlmostEqual(compared["periods"]["b"]["end"] - compared["periods"]["a"]["start"], 14 * 86_400e6, delta=1e6)
+        self.assertRegex(self.machine.ctl(*self.LAST_WEEK).out, "\nA: The store reaches back to .* only.\n")
+        # Over one period both sides have the same durations, so there is nothing to compare.
+        self.assertNotIn("durations", self.json("compare", "usual", "internal")[0])
 
 
 if __name__ == "__main__":

@@ -2,7 +2,8 @@
 //
 // Over one period both settings judge the same objects, so we can say for each object what changes.
 // That needs one reading of the store. Over two periods the objects differ and cannot be matched.
-// There we compare trace points instead: we list those that only one period reports.
+// There we compare trace points instead: we list those that only one period reports, and how long
+// each takes in both.
 
 #include <algorithm>
 #include <map>
@@ -10,7 +11,8 @@
 
 #include "platform/Text.h"
 #include "tesselctl/commands/Command.h"
-#include "tesselctl/judging/Tally.h"
+#include "tesselctl/judging/Durations.h"
+#include "tesselctl/showing/DurationOutput.h"
 #include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/SummaryOutput.h"
 
@@ -121,11 +123,19 @@ class Changes {
 
 std::string textOf(StringRef text) { return std::string(text.textOr("")); }
 
+// What only a comparison of two periods knows of each. Over one period both sides have the same
+// objects, which take as long.
+struct ComparedPeriod {
+  Durations durations;
+  StoreReading reading;
+};
+
 // The verdicts of both settings on a store, and the changes between them.
 struct Comparison {
   VerdictCounts sides[2] = {};
   Changes changes;
-  uint64_t notCompared = 0;  // objects of trace points beyond kMaxPaths
+  uint64_t notCompared = 0;  // objects of trace points that PointFigures has no room for
+  std::optional<ComparedPeriod> periods[2];
   std::optional<PlatformError> error;
   StoreReport unread;  // the files that any reading was refused, and the most that one left out
   Losses losses;       // of each reading
@@ -168,15 +178,39 @@ void compareJudges(const Setting (&settings)[2], const Reading& reading, Compari
   takeReading(run, comparison);
 }
 
-// What became of one trace point in each of two periods.
-struct PathFigures {
-  VerdictCounts sides[2] = {};
-};
-using Path = std::tuple<std::string, std::string, std::string>;
+// What became of each trace point in two periods.
+class PointFigures {
+ public:
+  // A program that puts numbers into its names makes new trace points without end. Objects beyond
+  // these bounds count in the sums of their side, but no change is found for them.
+  static constexpr size_t kMost = 65536;
+  static constexpr size_t kMostBytes = size_t{16} << 20;  // of subsystems, categories and names
 
-// A program that puts numbers into its names makes new paths without end. Objects of paths beyond
-// this bound count in the sums of their side, but no change is found for them. They are counted.
-constexpr size_t kMaxPaths = 65536;
+  struct Sides {
+    VerdictCounts counts[2] = {};
+  };
+  using Points = KeyedCounts<3, Sides>;
+
+  // False if there is no room for the trace point of the object.
+  bool count(const TesselObject& object, size_t side, TesselReporterClassification verdict) {
+    const Points::Key key{{object.subsystem(), object.category(), object.name()}};
+    Sides* sides = points_.find(key);
+    if (sides == nullptr) {
+      size_t bytes = bytes_;
+      for (const StringRef text : key.texts) bytes += text.textOr("").size();
+      if (points_.entries().size() >= kMost || bytes > kMostBytes) return false;
+      bytes_ = bytes;
+      sides = &points_.add(key);
+    }
+    ++sides->counts[side][verdict];
+    return true;
+  }
+  const std::vector<Points::Entry>& entries() const { return points_.entries(); }
+
+ private:
+  Points points_;
+  size_t bytes_ = 0;
+};
 
 // The verdict that held back most objects.
 std::string mainReason(const VerdictCounts& counts) {
@@ -194,38 +228,34 @@ std::string mainReason(const VerdictCounts& counts) {
 // Two periods, each with a judge of its own. A judge that went on would have used up caps in the
 // first period, and points of the second would seem to stop.
 void comparePeriods(const Setting (&settings)[2], const Reading& reading, Comparison& comparison) {
-  std::map<Path, PathFigures> paths;
+  PointFigures points;
   // After an error the second reading is skipped: the command fails and shows no figures.
   for (size_t side = 0; side < 2 && !comparison.error; ++side) {
     Judge judge(settings[side].machine);
+    ComparedPeriod& period = comparison.periods[side].emplace();
+    if (side == 1) period.durations.expect(comparison.periods[0]->durations);
     DryRun run(reading.store, [&](const TesselObject& object, const EntryHeader&) {
       const auto verdict = judge.inspect(object).classification;
       ++comparison.sides[side][verdict];
-      Path path(textOf(object.subsystem()), textOf(object.category()), textOf(object.name()));
-      const auto known = paths.find(path);
-      if (known != paths.end()) {
-        ++known->second.sides[side][verdict];
-      } else if (paths.size() < kMaxPaths) {
-        ++paths[std::move(path)].sides[side][verdict];
-      } else {
-        ++comparison.notCompared;
-      }
+      period.durations.count(object);
+      if (!points.count(object, side, verdict)) ++comparison.notCompared;
       return true;
     });
     // Each period is half of the work on the progress bar.
     const double half = static_cast<double>(side) / 2;
     comparison.error = readWithProgress(run, settings[side].period, true, half, half + 0.5);
     takeReading(run, comparison);
+    period.reading = run.report().store.reading;
   }
-  for (const auto& [path, figures] : paths) {
-    const uint64_t before = figures.sides[0][TesselReporterClassificationTelemetryReported];
-    const uint64_t after = figures.sides[1][TesselReporterClassificationTelemetryReported];
+  for (const auto& [texts, slot, figures] : points.entries()) {
+    const uint64_t before = figures.counts[0][TesselReporterClassificationTelemetryReported];
+    const uint64_t after = figures.counts[1][TesselReporterClassificationTelemetryReported];
     // Traffic differs from day to day. So a change is only a point that was reported in one period
     // and not once in the other.
     if ((before == 0) == (after == 0)) continue;
     const bool starts = before == 0;
-    comparison.changes.add({starts, std::get<0>(path), std::get<1>(path), std::get<2>(path),
-                            mainReason(figures.sides[starts ? 0 : 1]), 0, ""},
+    comparison.changes.add({starts, textOf(texts[0]), textOf(texts[1]), textOf(texts[2]),
+                            mainReason(figures.counts[starts ? 0 : 1]), 0, ""},
                            starts ? after : before);
   }
 }
@@ -239,6 +269,20 @@ void writeChange(JsonWriter& json, const Change& change, uint64_t count) {
   });
 }
 
+void writePeriods(JsonWriter& json, const Comparison& comparison) {
+  const auto& [a, b] = comparison.periods;
+  if (!a || !b) return;
+  addDurationChanges(json, a->durations, b->durations);
+  json.object("periods", [&] {
+    for (const auto& [name, period] : {std::pair{"a", &*a}, std::pair{"b", &*b}}) {
+      json.object(name, [&, &reading = period->reading] {
+        json.member("start", reading.rangeStart).member("end", reading.rangeEnd);
+        json.member("reaches_start", reading.reachesRangeStart());
+      });
+    }
+  });
+}
+
 std::string comparisonJson(const Comparison& comparison) {
   return objectLine([&](JsonWriter& json) {
     json.object("a", [&] { addVerdicts(json, comparison.sides[0]); });
@@ -249,8 +293,21 @@ std::string comparisonJson(const Comparison& comparison) {
                [&](const auto& counted) { writeChange(json, counted.first, counted.second); });
     json.member("changes_not_listed", comparison.changes.notListed());
     json.member("objects_not_compared", comparison.notCompared);
+    writePeriods(json, comparison);
     addLosses(json, comparison.losses);
   });
+}
+
+std::string periodsText(const Comparison& comparison, const Terminal& terminal) {
+  const auto& [a, b] = comparison.periods;
+  if (!a || !b) return "";
+  std::string out = durationChangesText(a->durations, b->durations, terminal);
+  // Without this, a store that is younger than a period looks like a machine that did nothing then.
+  for (const auto& [name, period] : {std::pair{"A: ", &*a}, std::pair{"B: ", &*b}}) {
+    if (const std::string part = partOfPeriod(period->reading); !part.empty())
+      out += "\n" + wrapped(name + part, terminal.width, 2) + ".\n";
+  }
+  return out;
 }
 
 std::string comparisonText(const Comparison& comparison, const CompareOptions& options,
@@ -287,6 +344,7 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
     out += "  " + counted(count, "object", "objects") + " had further changes\n";
   if (const uint64_t count = comparison.notCompared; count != 0)
     out += "  " + counted(count, "object", "objects") + " of further trace points not compared\n";
+  out += periodsText(comparison, terminal);
   if (!comparison.losses.empty()) out += "\n" + lossText(comparison.losses, terminal);
   return out;
 }
@@ -309,13 +367,15 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
 }
 
 const CommandText kCompare{
-    "compare", "Say what would start and what would stop being reported",
+    "compare", "Say what starts or stops being reported, and what became slower",
     "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
     "no-internal, a platform (as for --platform), since=DATE, until=DATE,\n"
     "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
     "trace\n"
-    "points are compared that are reported at all.\n\n"
+    "points are compared that are reported at all, and how long each took: what became slower\n"
+    "comes first.\n\n"
     "Examples:\n"
+    "  tesselctl compare since=-14d,until=-7d last=7d    (which became slower since last week)\n"
     "  tesselctl compare usual internal\n"
     "  tesselctl compare Selvin Quarro,internal --last 7d\n"
     "  tesselctl compare since=yesterday,until=today since=today"};

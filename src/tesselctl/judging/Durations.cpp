@@ -140,6 +140,15 @@ Durations::Values* Durations::addPoint(const Points::Key& key) {
   return &points_.add(key);
 }
 
+void Durations::expect(const Durations& earlier) {
+  for (const Points::Entry& entry : earlier.points_.entries()) {
+    Points::Key key{{}, entry.slot};
+    std::copy(entry.texts.begin(), entry.texts.end(), key.texts.begin());
+    const Values* const added = addPoint(key);
+    TESSEL_INVARIANT(added != nullptr);  // both have the same bounds, so what fitted there fits here
+  }
+}
+
 // Equal counts are ordered by name, so that two reports of one period are the same.
 std::vector<Durations::Row> Durations::rows(Measure measure) const {
   std::vector<const Points::Entry*> entries;
@@ -162,6 +171,111 @@ std::vector<Durations::Row> Durations::rows(Measure measure) const {
     rows.push_back({texts[0], texts[1], texts[2], values.sketch, values.negative});
   }
   return rows;
+}
+
+namespace {
+
+// What a quantile is likely to be if we had endless values of the same kind.
+struct Range {
+  float least = 0;
+  float most = 0;
+};
+
+// The values are a sample, so their quantile is off by chance. With a probability of 99 % the true
+// one lies between two ranks that depend on nothing but the number of values: how many fall below
+// the quantile is a binomial count, 2.58 of whose standard deviations we allow for. Discarded: a
+// fixed least number of values, which is too few for a 95th percentile and too many for a median.
+// Absent if one of the ranks is beyond the values, as for a median of fewer than 11.
+std::optional<Range> likelyRange(const QuantileSketch& sketch, double part) {
+  const auto count = static_cast<double>(sketch.count());
+  const double spread = 2.576 * std::sqrt(count * part * (1 - part));
+  const double low = std::floor(count * part - spread);
+  const double high = std::ceil(count * part + spread + 1);
+  if (low < 1 || high > count) return std::nullopt;
+  return Range{sketch.atRank(static_cast<uint64_t>(low)),
+               sketch.atRank(static_cast<uint64_t>(high))};
+}
+
+// A smaller change is not worth a line, and a sketch could not tell one of 3 %.
+constexpr double kLeastChange = 1.05;
+// The journal's clock counts microseconds. So 2 instead of 0 of them is no change. A frame rate has
+// the same bound, which only keeps the division whole.
+constexpr float kLeastValue = 1e-6F;
+
+struct QuantileChange {
+  double factor = 1;     // how many times slower
+  bool known = false;    // there are enough values to tell
+  bool certain = false;  // more than chance, and large enough
+};
+
+QuantileChange changeOf(const QuantileSketch& a, const QuantileSketch& b, double part,
+                        bool lowerIsSlower) {
+  const QuantileSketch& slowerIfLess = lowerIsSlower ? b : a;
+  const QuantileSketch& slowerIfMore = lowerIsSlower ? a : b;
+  const auto value = [&](const QuantileSketch& sketch) {
+    return double{std::max(sketch.quantile(part), kLeastValue)};
+  };
+  QuantileChange change{value(slowerIfMore) / value(slowerIfLess)};
+  const auto less = likelyRange(slowerIfLess, part);
+  const auto more = likelyRange(slowerIfMore, part);
+  change.known = less && more;
+  if (change.known) {
+    change.certain = (change.factor >= kLeastChange && more->least > less->most) ||
+                     (change.factor <= 1 / kLeastChange && more->most < less->least);
+  }
+  return change;
+}
+
+// An operation is slower if either its usual case or its bad case is. People feel both.
+void judge(DurationChange& change, Measure measure) {
+  using Verdict = DurationChange::Verdict;
+  if (change.a->count() == 0 || change.b->count() == 0) {
+    change.verdict = change.b->count() == 0 ? Verdict::onlyA : Verdict::onlyB;
+    return;
+  }
+  const bool lowerIsSlower = measure == Measure::frameRate;
+  const QuantileChange usual = changeOf(*change.a, *change.b, 0.5, lowerIsSlower);
+  const QuantileChange bad =
+      changeOf(*change.a, *change.b, lowerIsSlower ? 0.05 : 0.95, lowerIsSlower);
+  change.verdict = usual.known ? Verdict::same : Verdict::fewValues;
+  change.factor = usual.factor;
+  for (const QuantileChange& quantile : {usual, bad}) {
+    if (!quantile.certain) continue;
+    const bool slower = quantile.factor > 1;
+    // Of two changes the greater slowing counts. A speed-up counts only if nothing became slower.
+    if (change.verdict == Verdict::slower && quantile.factor < change.factor) continue;
+    if (change.verdict == Verdict::faster && !slower) continue;
+    change.verdict = slower ? Verdict::slower : Verdict::faster;
+    change.factor = quantile.factor;
+  }
+}
+
+}  // namespace
+
+std::vector<DurationChange> changesBetween(const Durations& a, const Durations& b,
+                                           Measure measure) {
+  static const QuantileSketch kNoValues;
+  std::vector<DurationChange> changes;
+  for (const auto& [texts, slot, values] : b.points_.entries()) {
+    if (slot != static_cast<uint8_t>(measure)) continue;
+    const Durations::Values* before = a.points_.find({{texts[0], texts[1], texts[2]}, slot});
+    DurationChange change{texts[0], texts[1], texts[2],
+                          before != nullptr ? &before->sketch : &kNoValues, &values.sketch};
+    if (change.a->count() + change.b->count() == 0) continue;  // negative values alone
+    judge(change, measure);
+    changes.push_back(change);
+  }
+  // Equal ones are ordered by name, so that two comparisons of the same periods are the same.
+  std::sort(changes.begin(), changes.end(), [](const DurationChange& x, const DurationChange& y) {
+    if (x.verdict != y.verdict) return x.verdict < y.verdict;
+    if (x.factor != y.factor) return x.factor > y.factor;
+    const auto path = [](const DurationChange& change) {
+      return std::tuple(change.subsystem.textOr(""), change.category.textOr(""),
+                        change.name.present(), change.name.textOr(""));
+    };
+    return path(x) < path(y);
+  });
+  return changes;
 }
 
 }  // namespace tessel::ctl

@@ -76,6 +76,8 @@ class QuantileSketch {
   std::vector<Octave> octaves_;
 };
 
+struct DurationChange;
+
 // What a sketch is of.
 enum class Measure : uint8_t { duration, frameRate };
 
@@ -94,6 +96,10 @@ class Durations {
   // also the frame rate. Other objects cost one comparison and no memory.
   void count(const TesselObject& object);
 
+  // Makes room for the trace points of an earlier period. Without it a flood in this period could
+  // take their room, and they would seem to be gone. REQUIRES: nothing was counted yet.
+  void expect(const Durations& earlier);
+
   // The values of one trace point. Borrowed; valid until the next count().
   struct Row {
     StringRef subsystem;
@@ -102,12 +108,13 @@ class Durations {
     const QuantileSketch& sketch;
     uint64_t negative = 0;  // values below zero, which the sketch leaves out
   };
-  // Most values first.
+  // Most values first. A trace point that was only expected has no values.
   std::vector<Row> rows(Measure measure) const;
   // Values of trace points that rows() has no room for.
   uint64_t notListed(Measure measure) const { return notListed_[static_cast<size_t>(measure)]; }
 
  private:
+  friend std::vector<DurationChange> changesBetween(const Durations&, const Durations&, Measure);
   struct Values {
     QuantileSketch sketch;
     uint64_t negative = 0;
@@ -126,5 +133,28 @@ class Durations {
   size_t textBytes_ = 0;
   uint64_t notListed_[2] = {};
 };
+
+// What became of one trace point from a period A to a later one, B.
+struct DurationChange {
+  enum class Verdict : uint8_t {
+    slower,     // by more than chance makes likely, and by 5 % or more
+    same,       // neither slower nor faster
+    faster,     // as slower, in the other direction
+    fewValues,  // of one period, too few to tell
+    onlyA,      // no values in the other period
+    onlyB,
+  };
+  StringRef subsystem;
+  StringRef category;
+  StringRef name;                     // may be absent
+  const QuantileSketch* a = nullptr;  // never null; borrowed, as the texts
+  const QuantileSketch* b = nullptr;
+  Verdict verdict = Verdict::same;
+  double factor = 1;  // how many times slower B is; below 1 it is faster. 1 for onlyA and onlyB
+};
+
+// In the order of Verdict, and within a verdict what became slowest first. Of a frame rate, slower
+// is lower. REQUIRES: `b` was made to expect `a`.
+std::vector<DurationChange> changesBetween(const Durations& a, const Durations& b, Measure measure);
 
 }  // namespace tessel::ctl

@@ -34,11 +34,12 @@ class KeyedCounts {
   };
 
   // The count of the key; null where it has none. Valid until the next add().
-  Count* find(const Key& key) {
+  const Count* find(const Key& key) const {
     const uint32_t number =
         index_.find(hashOf(key), [&](uint32_t other) { return matches(entries_[other], key); });
     return number == FlatIndex::kNone ? nullptr : &entries_[number].count;
   }
+  Count* find(const Key& key) { return const_cast<Count*>(std::as_const(*this).find(key)); }
   // The new count of a key. REQUIRES: it has none.
   Count& add(const Key& key) {
     index_.add(hashOf(key), static_cast<uint32_t>(entries_.size()));

@@ -2,9 +2,14 @@
 //
 // For a duration the upper quantiles are what a user waits for. For a frame rate the lower ones are
 // what a user sees as jerks, so only frame rates show them.
+//
+// On a terminal a value has three digits and a unit. Where there is no terminal, a program reads
+// the table, so values are plain numbers of one unit and no row is left out.
 
 #include "tesselctl/showing/DurationOutput.h"
 
+#include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
 #include <iterator>
@@ -49,81 +54,212 @@ std::string plainDigits(float value) {
   return {text, std::to_chars(text, std::end(text), value).ptr};
 }
 
-std::string shownPath(const Durations::Row& row) {
-  std::string path = terminalText(row.subsystem.textOr("-")) + " / ";
-  path += terminalText(row.category.textOr("-"));
-  if (row.name) path += " / " + terminalText(row.name.text());
-  return path;
-}
-
 struct Quantile {
-  const char* key;    // of JSON
-  const char* title;  // of a column
-  double part;        // 0 is the minimum, 1 the maximum
+  const char* name;
+  double part;  // 0 is the minimum, 1 the maximum
 };
-constexpr Quantile kDurationQuantiles[] = {
-    {"p50", "P50", 0.5}, {"p95", "P95", 0.95}, {"p99", "P99", 0.99}, {"max", "MAX", 1}};
-constexpr Quantile kFrameRateQuantiles[] = {
-    {"min", "MIN", 0},    {"p1", "P1", 0.01},   {"p5", "P5", 0.05}, {"p50", "P50", 0.5},
-    {"p95", "P95", 0.95}, {"p99", "P99", 0.99}, {"max", "MAX", 1}};
-// The upper ones leave the table room for the trace point.
-constexpr std::span<const Quantile> kShownFrameRates = std::span(kFrameRateQuantiles).first(4);
+constexpr Quantile kMin = {"min", 0}, kP1 = {"p1", 0.01}, kP5 = {"p5", 0.05}, kP50 = {"p50", 0.5},
+                   kP95 = {"p95", 0.95}, kP99 = {"p99", 0.99}, kMax = {"max", 1};
+constexpr Quantile kUpper[] = {kP50, kP95, kP99, kMax};
+constexpr Quantile kLower[] = {kP50, kP5, kP1, kMin};
+constexpr Quantile kAll[] = {kMin, kP1, kP5, kP50, kP95, kP99, kMax};
+
+// How the values of a measure are shown.
+struct Style {
+  Measure measure;
+  const char* key;    // of JSON
+  const char* title;  // of a table
+  const char* unit;   // of plain numbers
+  std::span<const Quantile> quantiles;
+  std::span<const Quantile> shown;  // in a table; a frame rate leaves the trace point some room
+  std::string (*text)(float);
+};
+constexpr std::array<Style, 2> kStyles = {
+    {{Measure::duration, "durations", "Durations", "seconds", kUpper, kUpper, secondsText},
+     {Measure::frameRate, "frame_rates", "Frame rates", "frames per second", kAll, kLower,
+      frameRateText}}};
 
 float valueOf(const QuantileSketch& sketch, const Quantile& quantile) {
   return quantile.part == 0 ? sketch.minimum() : sketch.quantile(quantile.part);
 }
 
-void writeRows(JsonWriter& json, const char* key, const std::vector<Durations::Row>& rows,
-               std::span<const Quantile> quantiles) {
-  json.array(key, rows, [&](const Durations::Row& row) {
-    json.object([&] {
-      // Each row has the same keys, as tools that make tables want it. So an absent text is empty.
-      json.member("subsystem", row.subsystem.textOr(""));
-      json.member("category", row.category.textOr("")).member("name", row.name.textOr(""));
-      json.member("count", row.sketch.count());
-      for (const Quantile& quantile : quantiles) {
-        // Where all values were negative there is no quantile; JSON shows NaN as null.
-        json.member(quantile.key,
-                    row.sketch.count() == 0 ? std::nanf("") : valueOf(row.sketch, quantile));
-      }
-      json.member("negative", row.negative);
-    });
-  });
+std::string shownValue(const Style& style, float value, const Terminal& terminal) {
+  return terminal.interactive ? style.text(value) : plainDigits(value);
 }
 
-std::string quantileTable(const Durations& durations, Measure measure,
-                          std::span<const Quantile> quantiles, std::string (*shown)(float),
+std::string heading(const Style& style, const Terminal& terminal) {
+  const std::string unit = terminal.interactive ? "" : std::string(" in ") + style.unit;
+  return "\n" + terminal.paint(Colour::strong, style.title + unit + ", within 1.6 %") + "\n";
+}
+
+std::string upper(std::string text) {
+  std::ranges::transform(text, text.begin(), [](char c) { return c >= 'a' ? c - 'a' + 'A' : c; });
+  return text;
+}
+
+// Of a row or a change.
+std::string shownPath(const auto& point) {
+  std::string path = terminalText(point.subsystem.textOr("-")) + " / ";
+  path += terminalText(point.category.textOr("-"));
+  if (point.name) path += " / " + terminalText(point.name.text());
+  return path;
+}
+
+// Each row has the same keys, as tools that make tables want it. So an absent text is empty.
+void writePath(JsonWriter& json, const auto& point) {
+  json.member("subsystem", point.subsystem.textOr(""));
+  json.member("category", point.category.textOr("")).member("name", point.name.textOr(""));
+}
+
+void writeSketch(JsonWriter& json, const Style& style, const QuantileSketch& sketch) {
+  json.member("count", sketch.count());
+  for (const Quantile& quantile : style.quantiles) {
+    // Without a value there is no quantile. JSON shows NaN as null.
+    json.member(quantile.name, sketch.count() == 0 ? std::nanf("") : valueOf(sketch, quantile));
+  }
+}
+
+// The lines below a table: what it does not show.
+std::string remainder(size_t listed, size_t all, uint64_t furtherValues) {
+  std::string out;
+  if (all > listed) {
+    out += "  ... and " + counted(all - listed, "more trace point", "more trace points") +
+           " (--json lists all)\n";
+  }
+  if (furtherValues != 0)
+    out += "  " + counted(furtherValues, "value", "values") + " of further trace points\n";
+  return out;
+}
+
+std::string quantileTable(const Style& style, const Durations& durations,
                           const Terminal& terminal) {
   std::vector<Table::Column> columns = {{"COUNT", Table::Align::right}};
-  for (const Quantile& quantile : quantiles)
-    columns.push_back({quantile.title, Table::Align::right});
+  for (const Quantile& quantile : style.shown)
+    columns.push_back({upper(quantile.name), Table::Align::right});
   columns.push_back({"TRACE POINT", Table::Align::left, true});
   Table table(std::move(columns));
-  const auto rows = durations.rows(measure);
+  auto rows = durations.rows(style.measure);
   uint64_t negative = 0;
-  size_t listed = 0;
-  const size_t most = terminal.limit(kShownPoints);
-  for (const Durations::Row& row : rows) {
-    negative += row.negative;
-    if (row.sketch.count() == 0 || listed == most) continue;
-    ++listed;
+  for (const Durations::Row& row : rows) negative += row.negative;
+  // Rows without a value stand last, since the most values come first.
+  while (!rows.empty() && rows.back().sketch.count() == 0) rows.pop_back();
+  const size_t shown = std::min(rows.size(), terminal.limit(kShownPoints));
+  for (const Durations::Row& row : std::span(rows).first(shown)) {
     std::vector<Table::Cell> cells = {terminal.number(row.sketch.count())};
-    for (const Quantile& quantile : quantiles) {
-      const float value = valueOf(row.sketch, quantile);
-      cells.emplace_back(terminal.interactive ? shown(value) : plainDigits(value));
-    }
+    for (const Quantile& quantile : style.shown)
+      cells.emplace_back(shownValue(style, valueOf(row.sketch, quantile), terminal));
     cells.emplace_back(shownPath(row));
     table.add(std::move(cells));
   }
   std::string out = table.empty() ? "" : table.render(terminal, 2);
-  if (rows.size() > listed && listed == most) {
-    out += "  ... and " + grouped(rows.size() - listed) + " more trace points (--json lists all)\n";
-  }
-  if (const uint64_t count = durations.notListed(measure); count != 0)
-    out += "  " + counted(count, "value", "values") + " of further trace points\n";
+  out += remainder(shown, rows.size(), durations.notListed(style.measure));
   if (negative != 0)
     out += "  " + counted(negative, "negative value", "negative values") + " left out\n";
+  return out.empty() ? "" : heading(style, terminal) + out;
+}
+
+using Verdict = DurationChange::Verdict;
+
+struct VerdictText {
+  const char* name;  // of JSON
+  const char* text;
+  Colour colour;
+};
+// In the order of Verdict.
+constexpr VerdictText kVerdictTexts[] = {
+    {"slower", "slower", Colour::bad},        {"same", "same", Colour::plain},
+    {"faster", "faster", Colour::good},       {"few_values", "few values", Colour::faint},
+    {"only_a", "only in A", Colour::caution}, {"only_b", "only in B", Colour::caution}};
+static_assert(std::size(kVerdictTexts) == static_cast<size_t>(Verdict::onlyB) + 1);
+
+const VerdictText& textOf(Verdict verdict) { return kVerdictTexts[static_cast<size_t>(verdict)]; }
+
+bool inBoth(const DurationChange& change) {
+  return change.verdict != Verdict::onlyA && change.verdict != Verdict::onlyB;
+}
+
+std::string factorText(const DurationChange& change) {
+  return inBoth(change) ? threeDigits(change.factor) : "";
+}
+
+// Two lines for a trace point: on 80 columns two periods do not fit beside its name. The usual and
+// the bad case are enough to see what the verdict rests on.
+std::string changeLines(const Style& style, const DurationChange& change,
+                        const Terminal& terminal) {
+  constexpr size_t kIndent = 16;
+  const auto both = [&](const std::string& a, const std::string& b) {
+    return change.verdict == Verdict::onlyA   ? a
+           : change.verdict == Verdict::onlyB ? b
+                                              : a + " -> " + b;
+  };
+  std::string figures;
+  for (const Quantile& quantile : style.shown.first(2)) {
+    const auto side = [&](const QuantileSketch& sketch) {
+      return sketch.count() == 0 ? "" : style.text(valueOf(sketch, quantile));
+    };
+    figures += std::string(quantile.name) + " " + both(side(*change.a), side(*change.b)) + ", ";
+  }
+  figures += both(grouped(change.a->count()), grouped(change.b->count())) + " values";
+  const VerdictText& verdict = textOf(change.verdict);
+  std::string label = verdict.text;
+  if (change.verdict == Verdict::slower) label = threeDigits(change.factor) + "x slower";
+  if (change.verdict == Verdict::faster) label = threeDigits(1 / change.factor) + "x faster";
+  label.resize(std::max(label.size() + 1, kIndent - 2), ' ');
+  return "  " + terminal.paint(verdict.colour, label) +
+         wrappedBeside(shownPath(change), terminal.width, kIndent) + "\n" +
+         std::string(kIndent, ' ') + wrappedBeside(figures, terminal.width, kIndent) + "\n";
+}
+
+// A row for a trace point, and each figure a column.
+std::string changeTable(const Style& style, const std::vector<DurationChange>& changes,
+                        const Terminal& terminal) {
+  std::vector<Table::Column> columns = {{"CHANGE"}, {"FACTOR"}, {"COUNT A"}, {"COUNT B"}};
+  for (const Quantile& quantile : style.shown) {
+    for (const char* side : {" A", " B"}) columns.push_back({upper(quantile.name) + side});
+  }
+  columns.push_back({"TRACE POINT", Table::Align::left, true});
+  Table table(std::move(columns));
+  for (const DurationChange& change : changes) {
+    std::vector<Table::Cell> cells = {textOf(change.verdict).name, factorText(change),
+                                      terminal.number(change.a->count()),
+                                      terminal.number(change.b->count())};
+    for (const Quantile& quantile : style.shown) {
+      for (const QuantileSketch* sketch : {change.a, change.b}) {
+        cells.emplace_back(
+            sketch->count() == 0 ? "" : shownValue(style, valueOf(*sketch, quantile), terminal));
+      }
+    }
+    cells.emplace_back(shownPath(change));
+    table.add(std::move(cells));
+  }
+  return table.render(terminal, 2);
+}
+
+// "1 slower, 12 same, 3 with few values".
+std::string verdictCounts(const std::vector<DurationChange>& changes) {
+  uint64_t counts[std::size(kVerdictTexts)] = {};
+  for (const DurationChange& change : changes) ++counts[static_cast<size_t>(change.verdict)];
+  std::string out;
+  for (size_t verdict = 0; verdict < std::size(counts); ++verdict) {
+    if (counts[verdict] == 0 && verdict != 0) continue;
+    out += (out.empty() ? "" : ", ") + grouped(counts[verdict]) + " " + kVerdictTexts[verdict].text;
+  }
   return out;
+}
+
+std::string changesText(const Style& style, const Durations& a, const Durations& b,
+                        const Terminal& terminal) {
+  const uint64_t further = a.notListed(style.measure) + b.notListed(style.measure);
+  const auto changes = changesBetween(a, b, style.measure);
+  if (changes.empty() && further == 0) return "";
+  std::string out = heading(style, terminal);
+  out += "  " + wrapped(verdictCounts(changes), terminal.width, 2) + "\n";
+  if (!terminal.interactive)
+    return out + changeTable(style, changes, terminal) + remainder(0, 0, further);
+  const size_t shown = std::min(changes.size(), terminal.limit(kShownPoints));
+  for (const DurationChange& change : std::span(changes).first(shown))
+    out += changeLines(style, change, terminal);
+  return out + remainder(shown, changes.size(), further);
 }
 
 }  // namespace
@@ -140,24 +276,44 @@ std::string secondsText(float seconds) {
 std::string frameRateText(float rate) { return threeDigits(rate) + " fps"; }
 
 void addDurations(JsonWriter& json, const Durations& durations) {
-  writeRows(json, "durations", durations.rows(Measure::duration), kDurationQuantiles);
-  json.member("durations_not_listed", durations.notListed(Measure::duration));
-  writeRows(json, "frame_rates", durations.rows(Measure::frameRate), kFrameRateQuantiles);
-  json.member("frame_rates_not_listed", durations.notListed(Measure::frameRate));
+  for (const Style& style : kStyles) {
+    json.array(style.key, durations.rows(style.measure), [&](const Durations::Row& row) {
+      json.object([&] {
+        writePath(json, row);
+        writeSketch(json, style, row.sketch);
+        json.member("negative", row.negative);
+      });
+    });
+    json.member(std::string(style.key) + "_not_listed", durations.notListed(style.measure));
+  }
 }
 
 std::string durationText(const Durations& durations, const Terminal& terminal) {
-  const std::string tables[] = {
-      quantileTable(durations, Measure::duration, kDurationQuantiles, secondsText, terminal),
-      quantileTable(durations, Measure::frameRate, kShownFrameRates, frameRateText, terminal)};
   std::string out;
-  if (!tables[0].empty()) {
-    const std::string unit = terminal.interactive ? "" : " in seconds";
-    out += "\n" + terminal.paint(Colour::strong, "Durations" + unit + ", within 1.6 %") + "\n" +
-           tables[0];
+  for (const Style& style : kStyles) out += quantileTable(style, durations, terminal);
+  return out;
+}
+
+void addDurationChanges(JsonWriter& json, const Durations& a, const Durations& b) {
+  for (const Style& style : kStyles) {
+    json.array(style.key, changesBetween(a, b, style.measure), [&](const DurationChange& change) {
+      json.object([&] {
+        json.member("change", textOf(change.verdict).name);
+        json.member("factor", inBoth(change) ? change.factor : std::nan(""));
+        writePath(json, change);
+        json.object("a", [&] { writeSketch(json, style, *change.a); });
+        json.object("b", [&] { writeSketch(json, style, *change.b); });
+      });
+    });
+    json.object(std::string(style.key) + "_not_listed", [&] {
+      json.member("a", a.notListed(style.measure)).member("b", b.notListed(style.measure));
+    });
   }
-  if (!tables[1].empty())
-    out += "\n" + terminal.paint(Colour::strong, "Frame rates") + "\n" + tables[1];
+}
+
+std::string durationChangesText(const Durations& a, const Durations& b, const Terminal& terminal) {
+  std::string out;
+  for (const Style& style : kStyles) out += changesText(style, a, b, terminal);
   return out;
 }
 

@@ -24,4 +24,10 @@ void addDurations(JsonWriter& json, const Durations& durations);
 // The trace points with most values as tables; empty where there are no values.
 std::string durationText(const Durations& durations, const Terminal& terminal);
 
+// The same two members for two periods side by side, what became slower first. REQUIRES, as of
+// durationChangesText(): `b` was made to expect `a`.
+void addDurationChanges(JsonWriter& json, const Durations& a, const Durations& b);
+// What became slower in words, and below that the trace points; empty where there are no values.
+std::string durationChangesText(const Durations& a, const Durations& b, const Terminal& terminal);
+
 }  // namespace tessel::ctl
