@@ -145,7 +145,8 @@ void Durations::expect(const Durations& earlier) {
     Points::Key key{{}, entry.slot};
     std::copy(entry.texts.begin(), entry.texts.end(), key.texts.begin());
     const Values* const added = addPoint(key);
-    TESSEL_INVARIANT(added != nullptr);  // both have the same bounds, so what fitted there fits here
+    TESSEL_INVARIANT(added !=
+                     nullptr);  // both have the same bounds, so what fitted there fits here
   }
 }
 
