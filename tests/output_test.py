@@ -249,12 +249,14 @@ class Pipes(OutputTest):
             with open(reader, "rb") as lines, open(writer, "wb") as pipe, subprocess.Popen(
                     [os.path.join(BIN, "tesselctl"), *arguments], env=self.machine.environment(), stdout=pipe,
                     stderr=subprocess.PIPE) as process:
-                self.addCleanup(process.kill)
                 pipe.close()
                 if arguments[0] == "events":
                     self.assertTrue(lines.readline())
                 lines.close()
-                self.assertEqual(process.communicate(timeout=60)[1], b"")
+                try:
+                    self.assertEqual(process.communicate(timeout=20)[1], b"")
+                finally:
+                    process.kill()
 
     def test_programs_tell_their_version(self):
         for program in ("tesselctl", "statora_forwarder"):

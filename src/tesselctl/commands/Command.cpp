@@ -90,7 +90,7 @@ void addColourOption(CLI::App& app, Invocation& invocation) {
   app.add_option("--color", invocation.colour,
                  "Colours: auto (on a terminal, unless $NO_COLOR is set), always or never [auto]")
       ->type_name("WHEN")
-      ->check(CLI::IsMember({"auto", "always", "never"}));
+      ->check(CLI::IsMember({"auto", "always", "never"}).description(""));
 }
 
 void addPeriodOptions(CLI::App& command, ReadingOptions& options) {
