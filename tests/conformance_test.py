@@ -11,6 +11,7 @@ import re
 import signal
 import subprocess
 import sys
+import tempfile
 import termios
 import time
 import unittest
@@ -177,6 +178,26 @@ class Conformance(unittest.TestCase):
         else:
             self.assertEqual((status, errors, int(after["TESSEL_LOST"])), (0, [], first))
 
+    def test_waits(self):
+        self.each(self.check_waits, RUNNERS)
+
+    def check_waits(self, language):
+        """A daemon that takes nothing costs a program one wait, and after it next to nothing."""
+        def record(wait):
+            runner = Runner(language, TESSEL_TRACE_WAIT=wait)
+            start = time.monotonic()
+            runner.repeat(BURST)
+            middle = time.monotonic()
+            runner.repeat(BURST)
+            runner.process.kill()  # its last entry would wait, too
+            runner.close()
+            return middle - start, time.monotonic() - middle
+
+        first, second = self.stopped_daemon(lambda: record("99999"))
+        self.assertTrue(1 <= first < 2 and second < 0.9, (first, second))
+        first, second = self.stopped_daemon(lambda: record("soon"))
+        self.assertTrue(0.02 <= first < 0.9 and second < 0.9, (first, second))
+
     def test_an_interval_that_lost_its_begin(self):
         self.each(self.check_lost_begin, RUNNERS)
 
@@ -270,6 +291,44 @@ class Conformance(unittest.TestCase):
         self.assertEqual([kind for kind, _ in ids][:5], [b"end", b"begin", b"begin", b"end", b"end"])
         self.assertEqual((ids[1][1], ids[2][1]), (ids[3][1], ids[4][1]))
         self.assertNotEqual(ids[1][1], ids[2][1])
+
+class Examples(unittest.TestCase):
+    def setUp(self):
+        directory = tempfile.TemporaryDirectory()
+        self.addCleanup(directory.cleanup)
+        self.directory = directory.name
+
+    def built(self, sources, prefix):
+        """What the examples include the header from, after they were configured and built alone."""
+        build = os.path.join(self.directory, "build-" + os.path.basename(prefix))
+        for command in (["-S", sources, "-B", build, "-DCMAKE_PREFIX_PATH=" + prefix], ["--build", build]):
+            result = subprocess.run(["cmake", *command], capture_output=True, text=True, check=False, env=CLEAN)
+            self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
+        with open(os.path.join(build, "CMakeFiles", "example_record_c.dir", "flags.make"), encoding="utf-8") as file:
+            return re.search(r"^C_INCLUDES = \S* ?(\S+)$", file.read(), re.M)[1]
+
+    def test_they_build_alone(self):
+        source = self.built(os.path.join(ROOT, "examples"), os.path.join(self.directory, "none"))
+        self.assertEqual(os.path.realpath(source.removeprefix("-I")), os.path.join(ROOT, "include"))
+        prefix = os.path.join(self.directory, "installed")
+        subprocess.run(["cmake", "--install", os.path.dirname(BIN), "--component", "reporter", "--prefix", prefix],
+                       check=True, stdout=subprocess.DEVNULL)
+        shipped = os.path.join(prefix, "share/doc/tessel-reporter/examples")
+        self.assertEqual(self.built(shipped, prefix), os.path.join(prefix, "include"))
+        flags = subprocess.run(["pkg-config", "--cflags", "tessel-trace"], check=True, capture_output=True, text=True,
+                               env={**CLEAN, "PKG_CONFIG_PATH": os.path.join(prefix, "share/pkgconfig")}).stdout.split()
+        subprocess.run(["cc", "-std=c11", "-Werror", *flags, os.path.join(shipped, "record.c"), "-o", prefix + "/c"], check=True)
+
+    def test_an_old_standard_is_one_error(self):
+        source = os.path.join(self.directory, "program.c")
+        with open(source, "w", encoding="ascii") as file:
+            file.write("#include <tessel/trace.h>\nint main(void) { return 0; }\n")
+        for compiler in (["gcc", "-std=c89"], ["gcc", "-std=c99"], ["g++", "-x", "c++", "-std=c++14"], ["clang-14", "-std=c99"]):
+            result = subprocess.run([*compiler, "-fsyntax-only", "-I", os.path.join(ROOT, "include"), source],
+                                    capture_output=True, text=True, check=False)
+            self.assertEqual(result.stderr.count("error: "), 1, result.stderr)
+            self.assertIn("needs C11 or C++17", result.stderr)
+
 
 def load_tests(_loader, tests, _pattern):
     """Without names on the command line: all tests but those of Conformance, which Daemon starts beside its daemon."""

@@ -113,7 +113,8 @@ func (m *message) putAttribute(attribute Attribute) {
 
 func (m *message) putAttributes(attributes []Attribute) {
 	if len(attributes) > AttributesMax {
-		m.refuse(syscall.E2BIG, fmt.Sprintf("there are %d attributes, the limit is %d", len(attributes), AttributesMax), "attributes")
+		words := fmt.Sprintf("there are %d attributes, the limit is %d", len(attributes), AttributesMax)
+		m.refuse(syscall.E2BIG, words, "attributes")
 		return
 	}
 	for i, attribute := range attributes {

@@ -118,7 +118,8 @@ def _attribute(key: Any, value: Any) -> bytes:
     if key is None or key == "":
         raise Refused(errno.ENOKEY, "an attribute has no key")
     if not isinstance(key, str) or "=" in key or "\n" in key:
-        raise Refused(errno.ENOKEY, "an attribute key holds '=' or a line feed" if isinstance(key, str) else "an attribute key is no str")
+        words = "an attribute key holds '=' or a line feed" if isinstance(key, str) else "an attribute key is no str"
+        raise Refused(errno.ENOKEY, words)
     if value is None:
         raise Refused(errno.EBADMSG, "an attribute has no value")
     size = len(key.encode("utf-8", "replace"))
@@ -133,7 +134,8 @@ def _attributes(attributes: Any) -> bytes:
     if not isinstance(attributes, Mapping):
         raise Refused(errno.EINVAL, "attributes are no mapping")
     if len(attributes) > ATTRIBUTES_MAX:
-        raise Refused(errno.E2BIG, f"there are {len(attributes)} attributes, the limit is {ATTRIBUTES_MAX}", "attributes")
+        words = f"there are {len(attributes)} attributes, the limit is {ATTRIBUTES_MAX}"
+        raise Refused(errno.E2BIG, words, "attributes")
     return b"".join(_attribute(key, value) for key, value in attributes.items())
 
 
@@ -239,8 +241,8 @@ class Interval(_Point):
         lost, self._lost = self._lost, False
         if lost:
             RECORDER.count_lost()
-        words = "the interval is not open" if self._error == 0 else "its begin was lost" if lost else "its begin was refused"
-        RECORDER.say("lost" if lost else "refused", words)
+        refused = "its begin was refused" if self._error else "the interval is not open"
+        RECORDER.say(*(("lost", "its begin was lost") if lost else ("refused", refused)))
         return self._error or errno.ECANCELED
 
     def __enter__(self) -> "Interval":

@@ -70,7 +70,11 @@ fn resolve() -> i32 {
 /// error, so it tells no mistakes there.
 fn mode_when_on() -> i32 {
     let check = environment("TESSEL_TRACE").as_deref() == Some("check") && !has_more_rights();
-    if check { CHECK } else { ON }
+    if check {
+        CHECK
+    } else {
+        ON
+    }
 }
 
 fn has_more_rights() -> bool {
@@ -226,7 +230,13 @@ fn connected() -> std::io::Result<i32> {
     // SAFETY: the value is an int that outlives the call.
     unsafe {
         let size = std::mem::size_of::<i32>() as u32;
-        libc::setsockopt(socket.as_raw_fd(), libc::SOL_SOCKET, libc::SO_SNDBUF, (&SEND_BUFFER as *const i32).cast(), size);
+        libc::setsockopt(
+            socket.as_raw_fd(),
+            libc::SOL_SOCKET,
+            libc::SO_SNDBUF,
+            (&SEND_BUFFER as *const i32).cast(),
+            size,
+        );
     }
     socket.connect(socket_path())?;
     let fd = socket.into_raw_fd();

@@ -285,7 +285,11 @@ impl<'a> Point<'a> {
         for (slot, pair) in self.numbers.iter().enumerate() {
             if let Some((label, value)) = pair {
                 message.put(["TESSEL_NUMBER1_NAME", "TESSEL_NUMBER2_NAME"][slot], label);
-                message.put_number(["TESSEL_NUMBER1_VALUE", "TESSEL_NUMBER2_VALUE"][slot], *value, ["number1", "number2"][slot]);
+                message.put_number(
+                    ["TESSEL_NUMBER1_VALUE", "TESSEL_NUMBER2_VALUE"][slot],
+                    *value,
+                    ["number1", "number2"][slot],
+                );
             }
         }
         message.put_attributes(self.attributes);

@@ -154,5 +154,9 @@ fn decimal(value: f64) -> String {
     }
     let text = format!("{:.*}", (digits - 1 - exponent) as usize, value);
     let text = if text.contains('.') { without_zeros(&text) } else { text };
-    if text.contains('.') { text } else { text + ".0" }
+    if text.contains('.') {
+        text
+    } else {
+        text + ".0"
+    }
 }

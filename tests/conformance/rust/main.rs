@@ -67,7 +67,11 @@ impl Runner {
             "e" | "a" => {
                 let interval = interval.as_mut().unwrap();
                 interval.point = self.point;
-                errno(if word.starts_with('e') { interval.end() } else { interval.end_animation(next().parse().unwrap()) })
+                errno(if word.starts_with('e') {
+                    interval.end()
+                } else {
+                    interval.end_animation(next().parse().unwrap())
+                })
             }
             "r" => (0..next().parse::<i32>().unwrap()).filter(|_| self.point.event().is_err()).count() as i32,
             "z" => {
@@ -90,7 +94,8 @@ impl Runner {
             if word == "new" {
                 let (subsystem, category) = (text(next()).unwrap_or(b""), text(next()).unwrap_or(b""));
                 let name = text(next());
-                self.point = name.map_or(Point::unnamed(subsystem, category), |name| Point::new(subsystem, category, name));
+                self.point =
+                    name.map_or(Point::unnamed(subsystem, category), |name| Point::new(subsystem, category, name));
                 self.attributes.clear();
             } else if word.starts_with('+') {
                 self.add(word, next);
@@ -110,7 +115,8 @@ impl Runner {
 }
 
 fn main() {
-    let mut runner = Runner { point: Point::unnamed("", ""), attributes: vec![], intervals: (0..8).map(|_| None).collect() };
+    let mut runner =
+        Runner { point: Point::unnamed("", ""), attributes: vec![], intervals: (0..8).map(|_| None).collect() };
     for line in std::io::stdin().lock().lines() {
         match runner.run(&line.unwrap()) {
             Some(answer) => println!("{}", answer),
