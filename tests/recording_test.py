@@ -123,7 +123,8 @@ class CommandLine(unittest.TestCase):
             off = {**os.environ, "TESSEL_TRACE": "0"}
             self.assertEqual(ctl("record", "event", "s", "c", *where, env=off).returncode, 0)
             around = ctl("record", "--subsystem", "s", "--category", "c", *where, "--", "sh", "-c", "exit 3", env=off)
-            self.assertEqual((around.returncode, os.listdir(store)), (3, []))
+            lines = ctl("record", "--stdin", *where, env=off, input="nonsense\n")
+            self.assertEqual((around.returncode, lines.returncode, lines.stderr, os.listdir(store)), (3, 0, "", []))
             ctl("record", "event", "s", "c", *where)
             ctl("record", "event", "s", "c", "--message", "asked for", "--field", "PRIORITY=5", *where)
             with open(os.path.join(store, "tessel.export"), encoding="utf-8") as file:

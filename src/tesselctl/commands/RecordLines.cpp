@@ -203,6 +203,8 @@ ExitStatus recordLines(int fd, const RecordedPoint& defaults, const RecordPoint&
   ExitStatus status = kDone;
   std::string lastFailure;
   while (const auto line = lines.next()) {
+    // Off, we still read: a closed pipe would end the program that feeds us.
+    if (!recordingEnabled()) continue;
     if (line->find_first_not_of(" \t\r") == std::string_view::npos) continue;
     ++points;
     std::optional<Failure> failure;
