@@ -27,6 +27,7 @@
 #include <optional>
 #include <span>
 
+#include "journal/DataMarks.h"
 #include "journal/EntryStream.h"
 #include "journal/JournalFile.h"
 #include "journal/StoreReport.h"
@@ -84,8 +85,9 @@ bool headerTellsTimes(JournalFile& file, const StopFlag& stop);
 
 class EntryWalk {
  public:
-  // Tells `report` of damage. All must outlive the walk.
-  EntryWalk(JournalFile& file, FileReport& report, const StopFlag& stop);
+  // Shows `marks` the data objects on its way and tells `report` of damage. All must outlive the
+  // walk.
+  EntryWalk(JournalFile& file, DataMarks& marks, FileReport& report, const StopFlag& stop);
 
   // Moves to the next entry. False at the end, or soon after the stop flag was set. The offsets of
   // the entries rise, so no entry comes twice.
@@ -105,8 +107,11 @@ class EntryWalk {
   static constexpr uint64_t kAny = UINT64_MAX - 1;
 
   bool atEnd() const;
+  void passData();
   ObjectHeader objectAt(uint64_t offset);
-  bool take(uint64_t offset, uint64_t end);
+  bool takeListed();
+  bool take(uint64_t offset);
+  void accept(uint64_t offset, uint64_t size);
   void compareWithList(uint64_t offset);
   bool listIsRight(uint64_t object);
   void advanceList();
@@ -121,6 +126,7 @@ class EntryWalk {
   bool stopped() const { return stop_.load(std::memory_order_relaxed); }
 
   JournalFile& file_;
+  DataMarks& marks_;
   FileReport& report_;
   const StopFlag& stop_;
   EntryChain chain_;

@@ -70,12 +70,6 @@ void WindowedFile::moveWindow(uint64_t start, size_t wanted) {
   TESSEL_INVARIANT(windowLength_ <= windowCapacity_);
 }
 
-std::span<const uint8_t> WindowedFile::restOfWindow(uint64_t offset) const {
-  const uint8_t* bytes = inWindow(offset, 0);
-  if (bytes == nullptr) return {};
-  return {bytes, windowLength_ - static_cast<size_t>(offset - windowStart_)};
-}
-
 uint64_t WindowedFile::nextWritten(uint64_t offset) const {
   const off_t found = ::lseek(fd_.get(), static_cast<off_t>(offset), SEEK_DATA);
   // ENXIO: nothing but a hole is left. Other errors mean that the file system knows no holes.

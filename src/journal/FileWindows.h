@@ -91,7 +91,11 @@ class WindowedFile {
   // Drops what is in the window, so that bytes which others wrote meanwhile are read.
   void forget() { windowLength_ = 0; }
   // Bytes of the window from `offset` on; empty if `offset` is not in the window.
-  std::span<const uint8_t> restOfWindow(uint64_t offset) const;
+  std::span<const uint8_t> restOfWindow(uint64_t offset) const {
+    const uint8_t* bytes = inWindow(offset, 0);
+    if (bytes == nullptr) return {};
+    return {bytes, windowLength_ - static_cast<size_t>(offset - windowStart_)};
+  }
   // The first offset, `offset` or later, that is not in a hole of the file, rounded down to eight
   // bytes. The search skips the holes of sparse files with this.
   uint64_t nextWritten(uint64_t offset) const;

@@ -45,8 +45,8 @@ JournalEntryStream::JournalEntryStream(std::unique_ptr<JournalFile> file, uint32
       file_(*owned_),
       number_(number),
       context_(context),
-      walk_(file_, context.report, context.stop),
-      places_(context.resources.placesLeft) {}
+      marks_(context.marks, context.resources.placesLeft),
+      walk_(file_, marks_, context.report, context.stop) {}
 
 bool JournalEntryStream::next() {
   if (walk_.next()) {
@@ -130,7 +130,7 @@ size_t JournalEntryStream::collectTokens() {
   }
   comparable_ = all == count;
   if (!comparable_) context_.report.addProblem("entry with too many fields", walk_.offset());
-  if (!context_.marks.empty() && !hasMark<Item>(items, count)) return 0;
+  if (marks_.any() && !hasMark<Item>(items, count)) return 0;
   return tokensOf<Item>(items, count);
 }
 
@@ -138,48 +138,32 @@ size_t JournalEntryStream::collectTokens() {
 // They are templates, so that they need not ask for the layout in each round.
 template <typename Item>
 bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
-  MarkPlaces::View places(places_);
+  DataMarks::Plain plain(marks_);
   for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
        item += kStep<Item>) {
     const uint64_t offset = load<Item>(item);
-    MarkPlaces::State state = places.at(offset);
-    if (state == MarkPlaces::plain) [[likely]]
+    if (plain.has(offset)) [[likely]]
       continue;
-    if (state == MarkPlaces::unknown) {
-      state = look(offset);
-      places = MarkPlaces::View(places_);
-    }
-    if (state == MarkPlaces::mark) return true;
+    if (isMark(offset)) return true;
+    plain = DataMarks::Plain(marks_);
   }
   return false;
 }
 
-// Looks at a data object for the first time. One that cannot be read counts as a mark: its entry is
-// then read, and the damage told.
-MarkPlaces::State JournalEntryStream::look(uint64_t offset) {
-  // Nearly always the object stands in the window, before its first entry.
-  const auto head = file_.headInWindow(offset, kMaxMark);
-  const MarkPlaces::State state = head.empty() ? lookFarther(offset) : stateOf(head);
-  // Without memory for the answer we would look at the object again for each entry that has it. The
-  // tokens of these entries are in the cache, so to collect them costs less.
-  return places_.set(offset, state) ? state : MarkPlaces::mark;
-}
-
-MarkPlaces::State JournalEntryStream::lookFarther(uint64_t offset) {
+// Looks at the data object if the walk did not show it to `marks_`. One that cannot be read counts
+// as a mark: its entry is then read, and the damage told. So does one whose state cannot be
+// remembered, because we would look at it again for each entry that has it. The tokens of these
+// entries are in the cache, so to collect them costs less.
+bool JournalEntryStream::isMark(uint64_t offset) {
+  if (const auto known = marks_.at(offset); known != DataMarks::unknown)
+    return known == DataMarks::mark;
   DataObject data;
-  if (!file_.readData(offset, kMaxMark, context_.resources.data, data)) return MarkPlaces::mark;
-  if (data.compression == 0) return stateOf(data.head);
+  if (!file_.readData(offset, kMaxMark, context_.resources.data, data)) return true;
+  if (data.compression == 0) return marks_.see(offset, textOf(data.head)) != DataMarks::plain;
   const std::span<uint8_t> text = std::span(context_.resources.text).first(kMaxMark);
   const auto result = decompress(data, text);
-  if (!result || result->produced == 0) return MarkPlaces::mark;
-  return stateOf(text.first(result->produced));
-}
-
-MarkPlaces::State JournalEntryStream::stateOf(std::span<const uint8_t> head) const {
-  const std::string_view text = textOf(head);
-  for (const std::string_view mark : context_.marks)
-    if (text.front() == mark.front() && text.starts_with(mark)) return MarkPlaces::mark;
-  return MarkPlaces::plain;
+  return !result || result->produced == 0 ||
+         marks_.see(offset, textOf(text.first(result->produced))) != DataMarks::plain;
 }
 
 // The loop writes each token and then moves on only if the token is wanted: that spares a branch

@@ -6,7 +6,7 @@
 //
 // Few entries of a day have a mark (see FieldTokenizer::marks()), and to make tokens of all fields
 // of all entries would be most of the work. So we first ask of each field only whether it is a
-// mark. MarkPlaces answers that for every data object that was looked at before. Nothing but the
+// mark. DataMarks answers that, because the walk has shown it every data object. Nothing but the
 // entry itself and the data objects that it names has a say, so no wrong word elsewhere can hide an
 // entry. A trace point has several marks, so one wrong word in the entry cannot hide it either.
 //
@@ -26,6 +26,7 @@
 #include <string_view>
 #include <vector>
 
+#include "journal/DataMarks.h"
 #include "journal/Decompressor.h"
 #include "journal/EntryStream.h"
 #include "journal/EntryWalk.h"
@@ -48,7 +49,7 @@ struct JournalReadResources {
   std::array<uint8_t, JournalFile::kMaxDataHeader + kLongestHashed> data;
   std::array<uint8_t, kLongestHashed> text;
   std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the current entry
-  size_t placesLeft = MarkPlaces::kTotal;
+  size_t placesLeft = DataMarks::kTotal;
 };
 
 class JournalEntryStream final : public EntryStream {
@@ -83,9 +84,7 @@ class JournalEntryStream final : public EntryStream {
   size_t collectTokens();
   template <typename Item>
   bool hasMark(const uint8_t* items, size_t count);
-  MarkPlaces::State look(uint64_t offset);
-  MarkPlaces::State lookFarther(uint64_t offset);
-  MarkPlaces::State stateOf(std::span<const uint8_t> head) const;
+  bool isMark(uint64_t offset);
   template <typename Item>
   size_t tokensOf(const uint8_t* items, size_t count);
   template <typename Item>
@@ -101,8 +100,8 @@ class JournalEntryStream final : public EntryStream {
   JournalFile& file_;
   const uint32_t number_;
   Context context_;
+  DataMarks marks_;
   EntryWalk walk_;
-  MarkPlaces places_;
   // Boot and difference of the two clocks, as the entries before had them.
   Id128 usualBoot_{};
   uint64_t usualDifference_ = 0;

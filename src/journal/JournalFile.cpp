@@ -85,7 +85,7 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
   // Computed first: at() may find the file cut before `offset`, and objectsEnd() then moves.
   const uint64_t room = objectsEnd() - offset;
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
-  if (at == nullptr || *at != kEntry) return 0;
+  if (at == nullptr || load<uint16_t>(at) != kEntry) return 0;  // an entry has no flags
   const auto size = load<uint64_t>(at + kObjectSizeAt);
   if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
   entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);

@@ -131,17 +131,14 @@ class JournalFile {
   // out the entries that come next. What is not in the window is read into `scratch`, which has
   // room for `most` and kMaxDataHeader bytes.
   bool readData(uint64_t offset, size_t most, std::span<uint8_t> scratch, DataObject& data);
-  // The beginning of the payload, up to `most` bytes, of a data object that is not compressed and
-  // stands in the window; empty otherwise. The quick way to what nearly always is there.
-  std::span<const uint8_t> headInWindow(uint64_t offset, size_t most) const {
+  // The size of the data object that begins at `at`, if it is valid and not compressed; otherwise,
+  // or if it is longer than `room` bytes, 0.
+  uint64_t plainDataSize(const uint8_t* at, uint64_t room) const {
     using namespace journal_format;
-    const uint8_t* at = file_.inWindow(offset, dataHeaderSize_ + most);
-    if (at == nullptr || load<uint16_t>(at) != kData || !aligned(offset)) return {};
     const auto size = load<uint64_t>(at + kObjectSizeAt);
-    if (size <= dataHeaderSize_ || size > objectsEnd() - offset) return {};
-    return {at + dataHeaderSize_,
-            static_cast<size_t>(std::min<uint64_t>(size - dataHeaderSize_, most))};
+    return load<uint16_t>(at) == kData && size > dataHeaderSize_ && size <= room ? size : 0;
   }
+  size_t dataHeaderSize() const { return dataHeaderSize_; }
   // Whether the hash of a data object with this text is `hash`.
   bool hashOfData(std::span<const uint8_t> text, uint64_t hash) const;
 

@@ -1,6 +1,5 @@
-// What is remembered of data objects, so that each is read seldom more than once.
-//
-// TokenCache: which token a data object of a file has, and a part of its hash.
+// TokenCache remembers which token a data object of a file has, and a part of its hash, so that
+// each object is read seldom more than once.
 //
 // Without it each field of each entry would cost a read and a lookup. One cache serves all files of
 // a store, so its size does not depend on the files. A table of all data objects would have no
@@ -25,10 +24,6 @@
 // together are the whole key: the number of the file and the offset divided by eight, because
 // objects begin at multiples of eight.
 //
-// MarkPlaces: whether a data object was looked at, and whether it makes its entries worth reading.
-// This is asked for every field of every entry, so it is two bits in a table that the processor
-// keeps near.
-//
 // Threads: one at a time.
 
 #pragma once
@@ -36,8 +31,6 @@
 #include <algorithm>
 #include <cstdint>
 #include <memory>
-#include <utility>
-#include <vector>
 
 #include "journal/EntryStream.h"
 
@@ -183,65 +176,6 @@ class TokenCache {
   uint32_t generation_ = 0;
   Table<kRecurringLineBits, kRecurringStretchBits> recurring_;
   Table<kAwaitedLineBits, kAwaitedStretchBits> awaited_;
-};
-
-// The data objects of one file. Data objects are longer than 64 bytes, so each has a place of its
-// own among the stretches of 64 bytes.
-class MarkPlaces {
- public:
-  enum State : uint8_t { unknown = 0, plain = 1, mark = 2 };
-
-  // Bytes for the tables of all files of a store. They serve 2 GiB of files that are read at once;
-  // most files follow one another.
-  static constexpr size_t kTotal = size_t{8} << 20;
-
-  // Takes its memory from `bytesLeft`, which must outlive it, and gives it back at its end.
-  explicit MarkPlaces(size_t& bytesLeft) : bytesLeft_(bytesLeft) {}
-  ~MarkPlaces() { bytesLeft_ += words_.size() * sizeof(uint64_t); }
-  MarkPlaces(const MarkPlaces&) = delete;
-  MarkPlaces& operator=(const MarkPlaces&) = delete;
-
-  // The table as it is now, for a loop. Void after set().
-  class View {
-   public:
-    explicit View(const MarkPlaces& places)
-        : words_(places.words_.data()), size_(places.words_.size()), first_(places.first_) {}
-    State at(uint64_t offset) const {
-      const uint64_t word = (offset >> kWordShift) - first_;  // huge if it is below the table
-      return word < size_ ? State(words_[word] >> shiftOf(offset) & 3) : unknown;
-    }
-
-   private:
-    const uint64_t* words_;
-    size_t size_;
-    uint64_t first_;
-  };
-
-  // Remembers the state of an object that was unknown. False if there is no memory left for it.
-  bool set(uint64_t offset, State state) {
-    if (words_.empty()) first_ = offset >> kWordShift;
-    const uint64_t word = (offset >> kWordShift) - first_;
-    if (word >= words_.size() && !grow(word)) return false;
-    words_[word] |= uint64_t{state} << shiftOf(offset);
-    return true;
-  }
-
- private:
-  static constexpr int kWordShift = 11;  // a word holds 32 places of 64 bytes
-  static int shiftOf(uint64_t offset) { return static_cast<int>(offset >> 5 & 62); }
-
-  bool grow(uint64_t word) {
-    const uint64_t size = std::max<uint64_t>(word + word / 2, 64);
-    const uint64_t more = (size - words_.size()) * sizeof(uint64_t);
-    if (word > kTotal || more > bytesLeft_) return false;
-    bytesLeft_ -= static_cast<size_t>(more);
-    words_.resize(static_cast<size_t>(size));
-    return true;
-  }
-
-  size_t& bytesLeft_;
-  uint64_t first_ = 0;  // the number of the first word: the objects begin behind large tables
-  std::vector<uint64_t> words_;
 };
 
 }  // namespace tessel
