@@ -54,7 +54,7 @@ var (
 func resolve() {
 	resolved.Do(func() {
 		value := os.Getenv("TESSEL_TRACE")
-		check = value == "check"
+		check = value == "check" && !hasMoreRights()
 		waitMax = waitFrom(os.Getenv("TESSEL_TRACE_WAIT"))
 		now := modeOn
 		if value == "0" {
@@ -185,10 +185,28 @@ func (c *connection) isOurs() bool {
 		status.Mode&syscall.S_IFMT == syscall.S_IFSOCK
 }
 
+// hasMoreRights tells whether the program runs with more rights than its caller, as the kernel sees
+// it. Then the caller's environment chooses no socket, and standard error may be something else.
+func hasMoreRights() bool {
+	const atSecure = 23
+	vector, err := os.ReadFile("/proc/self/auxv")
+	count := len(vector) / int(unsafe.Sizeof(uintptr(0)))
+	if err != nil || count == 0 {
+		return os.Getuid() != os.Geteuid() || os.Getgid() != os.Getegid()
+	}
+	words := unsafe.Slice((*uintptr)(unsafe.Pointer(&vector[0])), count)
+	for i := 0; i+1 < count; i += 2 {
+		if words[i] == atSecure {
+			return words[i+1] != 0
+		}
+	}
+	return false
+}
+
 // socketPath asks the environment, but not in a program with more rights than its caller.
 func socketPath() string {
 	path := os.Getenv("TESSEL_JOURNAL_SOCKET")
-	if path == "" || os.Getuid() != os.Geteuid() || os.Getgid() != os.Getegid() {
+	if path == "" || hasMoreRights() {
 		return journalSocket
 	}
 	return path

@@ -52,6 +52,17 @@ def _wait_from_environment() -> int:
     return min(int(text), WAIT_MS_MAX) if text.isascii() and text.isdigit() else WAIT_MS
 
 
+def _has_more_rights() -> bool:
+    """Whether the program runs with more rights than its caller, as the kernel sees it. Then the caller's
+    environment chooses no socket, and standard error may be something else."""
+    at_secure = 23
+    try:
+        with open("/proc/self/auxv", "rb") as file:
+            return dict(struct.iter_unpack("@NN", file.read())).get(at_secure, 0) != 0
+    except (OSError, struct.error):
+        return os.getuid() != os.geteuid() or os.getgid() != os.getegid()
+
+
 def _caller() -> Tuple[str, int]:
     """File and line that called into the package."""
     frame = sys._getframe(1)
@@ -90,7 +101,7 @@ class Recorder:
 
     def _resolve(self) -> None:
         value = os.environ.get("TESSEL_TRACE", "")
-        self._check = value == "check"
+        self._check = value == "check" and not _has_more_rights()
         self._wait_ns = _wait_from_environment() * 1_000_000
         self._mode = value != "0"
 
@@ -270,7 +281,7 @@ class Recorder:
 
     @staticmethod
     def _path() -> str:
-        return os.environ.get("TESSEL_JOURNAL_SOCKET") or SOCKET
+        return (os.environ.get("TESSEL_JOURNAL_SOCKET") if not _has_more_rights() else None) or SOCKET
 
 
 RECORDER = Recorder()
