@@ -83,7 +83,7 @@ def fill(path, events):
     chooser = random.Random(1)
 
     def rows():
-        at = 1_795_000_000_000_000
+        at = int(time.time() * 1e6) - 3_600_000_000
         for number in range(events):
             if number % 2 == 0:  # each object is sent twice
                 payload = some_payload(chooser)

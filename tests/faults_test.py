@@ -118,7 +118,7 @@ class Disk(FaultTest):
         machine = self.machine(some_points(60))
         for environment, log_rows, lost in (({"TESSEL_SPOOL_LIMIT": str(4 << 20)}, 0, 3), ({}, 60, 1)):
             machine.forget_state()
-            self.assert_clean(machine.run())
+            self.assert_clean(machine.run(**environment))
             with contextlib.closing(sqlite3.connect(os.path.join(machine.state, "statora.db"))) as client:
                 client.execute("PRAGMA wal_autocheckpoint=0")
                 for _ in range(log_rows):

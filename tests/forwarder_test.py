@@ -34,7 +34,8 @@ def make_spool(state):
     path = os.path.join(state, "statora.db")
     with contextlib.closing(sqlite3.connect(path, isolation_level=None)) as database:
         database.executescript(SCHEMA)
-        database.execute("INSERT INTO meta VALUES('spool_id', ?)", (SPOOL_ID,))
+        database.execute("INSERT INTO meta VALUES('spool_id', ?), ('limit_bytes', '1073741824'), ('limit_days', '30')",
+                         (SPOOL_ID,))
     return path
 
 
@@ -45,13 +46,15 @@ class ForwarderTest(unittest.TestCase):
         self.path = make_spool(self.state)
         self.errors = ""
 
-    def add(self, count=1, payload='{"Name":"Open","Number1Value":%d}', name="com.vantor.performance.tessel"):
+    def add(self, count=1, payload='{"Name":"Open","Number1Value":%d}', name="com.vantor.performance.tessel",
+            at=None):
         """Adds rows; %d in the payload counts them."""
+        at = int(time.time() * 1e6) if at is None else at
         with sqlite3.connect(self.path) as database:
             for number in range(count):
                 text = payload % number if "%d" in payload else payload
                 database.execute("INSERT INTO events(time, name, payload) VALUES(?, ?, ?)",
-                                 (1_795_000_000_000_000 + number, name, text))
+                                 (at + number, name, text))
 
     def query(self, sql):
         with sqlite3.connect(self.path) as database:
@@ -89,7 +92,8 @@ class ForwarderTest(unittest.TestCase):
 class Delivery(ForwarderTest):
     def test_a_record_keeps_kinds_and_order_of_the_event(self):
         self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,"G":5.0,'
-                         '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open")
+                         '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open",
+                 at=1_795_000_000_000_000)
         with Receiver() as receiver:
             self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
         request = receiver.requests[0]
@@ -372,6 +376,9 @@ class Process(ForwarderTest):
                 process.wait()
                 with sqlite3.connect(self.path) as database:
                     self.assertEqual(database.execute("PRAGMA integrity_check").fetchone()[0], "ok")
+                    if database.execute("SELECT 1 FROM sqlite_schema WHERE name='forwarder_delivered'").fetchone():
+                        rows = database.execute("SELECT id FROM forwarder_delivered UNION ALL SELECT id FROM events ORDER BY 1")
+                        self.assertEqual([id for (id,) in rows], list(range(1, total + 1)), "each row stands once")
                 if self.waiting() < 2000:  # so that every kill finds work
                     self.add(2000)
                     total += 2000
@@ -382,6 +389,8 @@ class Process(ForwarderTest):
                 texts.setdefault(uid_of(record), set()).add(json.dumps(record))
         self.assertEqual(set(texts), {f"{SPOOL_ID}-{number}" for number in range(1, total + 1)})
         self.assertTrue(all(len(kinds) == 1 for kinds in texts.values()), "the same identifier is the same record")
+        self.assertEqual(self.query("SELECT id FROM forwarder_delivered ORDER BY number"),
+                         [(number,) for number in range(1, total + 1)], "a copy of each, and one only")
 
 
 if __name__ == "__main__":

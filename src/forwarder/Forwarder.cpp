@@ -106,6 +106,7 @@ Forwarder::Forwarder(World world, const ForwarderOptions& options)
 ForwarderOutcome Forwarder::deliverAll() {
   refusals_ = 0;
   reason_.clear();
+  world_.state.shortenDelivered(world_.clock.now());
   for (;;) {
     std::vector<SpooledEvent> events = world_.state.oldest(options_.maxRecords, options_.maxBytes);
     SqliteStatus status = world_.state.status();
@@ -194,6 +195,8 @@ bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
   world_.status.say("Waiting for the collector: " + words);
   ++world_.state.counters().retries;
   world_.state.storeCounters();
+  // An outage may last for days, and delivered rows are past theirs meanwhile.
+  world_.state.shortenDelivered(world_.clock.now());
   return takeBreak(backoff_.wait(failures, world_.chance(), answer.retryAfter));
 }
 
@@ -211,9 +214,10 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
     kForwarderLog.error("The collector rejected %llu records: %@", partial.rejected,
                         partial.message);
   }
-  std::vector<int64_t> ids;
-  for (const OutgoingRecord& record : part) ids.push_back(record.event.id);
-  const SqliteStatus status = world_.state.acknowledge(ids, partial.rejected, world_.clock.now());
+  std::vector<const SpooledEvent*> rows;
+  for (const OutgoingRecord& record : part) rows.push_back(&record.event);
+  const SqliteStatus status =
+      world_.state.acknowledge(rows, partial.rejected, options_.destination, world_.clock.now());
   return status.ok() ? Sent::accepted : fail(ForwarderOutcome::spoolFailed, status.reason);
 }
 

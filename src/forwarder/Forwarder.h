@@ -91,6 +91,7 @@ struct ForwarderOptions {
   std::chrono::milliseconds longestRetry{300'000};
   uint32_t refusalsInARow = 16;     // so many mean that the collector itself is at fault
   uint64_t recordsPerSecond = 100;  // 0: no limit
+  std::string destination;          // stands with the delivered rows; see ForwarderSettings
 };
 
 // How an attempt to deliver everything ended.

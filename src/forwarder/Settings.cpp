@@ -141,14 +141,17 @@ bool isLoopback(const std::string& host) {
   return inet_pton(AF_INET, host.c_str(), &address) == 1 && (ntohl(address.s_addr) >> 24) == 127;
 }
 
-// Whether events may be sent to the URL `text`. Plain http shows events and credentials to the
-// network. So it needs the operator's consent, unless the request stays on this machine.
-bool acceptable(const std::string& text, bool allowHttp) {
+// Scheme, host and port of the URL `text`, if events may be sent there. Plain http shows events and
+// credentials to the network. So it needs the operator's consent, unless the request stays on this
+// machine.
+std::optional<std::string> acceptedDestination(const std::string& text, bool allowHttp) {
   const CurlUrl url(curl_url(), &curl_url_cleanup);
-  if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return false;
+  if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return {};
   const std::string scheme = urlPart(url.get(), CURLUPART_SCHEME);
-  if (scheme == "https") return true;
-  return scheme == "http" && (allowHttp || isLoopback(urlPart(url.get(), CURLUPART_HOST)));
+  const std::string host = urlPart(url.get(), CURLUPART_HOST);
+  if (scheme != "https" && !(scheme == "http" && (allowHttp || isLoopback(host)))) return {};
+  const std::string port = urlPart(url.get(), CURLUPART_PORT);
+  return scheme + "://" + host + (port.empty() ? "" : ":" + port);
 }
 
 const OutputFormat* readOutput(Variables& variables) {
@@ -177,11 +180,13 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
     while (settings.url.ends_with('/')) settings.url.pop_back();
     settings.url += settings.output->path;
   }
-  if (!acceptable(settings.url, allowHttp)) {
+  const auto destination = acceptedDestination(settings.url, allowHttp);
+  if (!destination) {
     variables.complain(
         endpoint->name, endpoint->value,
         "an https URL, or an http one to loopback (to any host with TESSEL_FORWARD_ALLOW_HTTP=1)");
   }
+  settings.destination = destination.value_or("");
 }
 
 // The error names the source of the headers and never shows them.

@@ -31,6 +31,9 @@ namespace tessel {
 struct ForwarderSettings {
   const OutputFormat* output = outputFormats().front();
   std::string url;
+  // Where the events go, for people: scheme, host and port of the URL. Users, passwords, paths and
+  // queries may hold secrets.
+  std::string destination;
   std::vector<std::string> headers;  // each "name: value"
   std::chrono::milliseconds timeout{10'000};
   bool compress = false;

@@ -171,6 +171,7 @@ class Service {
     ForwarderOptions options;
     options.firstRetry = settings.retry;
     options.recordsPerSecond = settings.recordsPerSecond;
+    options.destination = settings.destination;
     return options;
   }
 

@@ -1,10 +1,11 @@
 // Reading, acknowledging and setting aside rows of the spool.
 //
 // Delivery is at least once. A row leaves `events` only after a collector has taken or refused it,
-// in the same transaction that moves the counters. If the forwarder dies between the collector's
-// answer and that transaction, the next forwarder sends the row again under the same identifier
-// (spool id and row id), and the backend keeps one of the two. Exactly once would need a collector
-// that remembers identifiers in a transaction with us, and none does.
+// in the same transaction that moves the counters and copies the row to where delivered rows stay.
+// So after a kill at any moment a row stands in one table, and only in one. If the forwarder dies
+// between the collector's answer and that transaction, the next forwarder sends the row again under
+// the same identifier (spool id and row id), and the backend keeps one of the two. Exactly once
+// would need a collector that remembers identifiers in a transaction with us, and none does.
 //
 // A collector may refuse a row for ever, and all later rows would wait behind it. So such a row
 // moves to `forwarder_set_aside`, together with the collector's words. It stays there until
@@ -33,9 +34,18 @@ namespace {
 // The forwarder loses nothing by waiting, so it waits longer.
 constexpr int kForwardersPatience = 5000;  // milliseconds
 
-// Rows that one transaction removes. The service may wait for the lock at any moment. A full batch
-// of 512 rows would hold it four times as long.
-constexpr size_t kRowsRemovedAtOnce = 128;
+// Rows that one transaction moves. The service may wait for the lock at any moment. A full batch
+// of 512 rows would hold it four times as long. Large rows are counted by their bytes: the log of
+// the smallest spool may have 128 KiB between two checkpoints.
+constexpr size_t kRowsMovedAtOnce = 128;
+constexpr uint64_t kBytesMovedAtOnce = uint64_t{96} << 10;
+
+// Acknowledgements make the log grow. The service empties it at 4000 pages, in the middle of a run.
+// The forwarder does so much earlier, to spare the service the work.
+constexpr int64_t kForwardersCheckpointPages = 500;
+
+// Rows that a look for expired rows reads. A look comes every 30 seconds and must cost nothing.
+constexpr int64_t kRowsLookedAt = 32;
 
 // A newer service may only have added to the spool. It then says in `compatible_from` the oldest
 // version that still finds its way. Without that word a newer spool may mean anything, and sending
@@ -87,20 +97,6 @@ std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database)
   return counters;
 }
 
-std::vector<SpooledEvent> readEvents(SqliteStatement& select, int64_t after, size_t maxRows,
-                                     size_t maxBytes) {
-  std::vector<SpooledEvent> events;
-  size_t bytes = 0;
-  select.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
-  while (bytes < maxBytes && select.step() == SqliteStatement::Step::row) {
-    events.push_back({select.integer(0), select.integer(1), std::string(select.text(2)),
-                      std::string(select.text(3))});
-    bytes += events.back().name.size() + events.back().payload.size();
-  }
-  select.reset();
-  return events;
-}
-
 ForwarderState::ForwarderState(std::string stateDirectory, uint64_t maxSetAside)
     : path_(std::move(stateDirectory) + "/" + kSpoolFileName), maxSetAside_(maxSetAside) {}
 
@@ -120,17 +116,20 @@ SqliteStatus ForwarderState::open() {
 
 SqliteStatus ForwarderState::openAndPrepare() {
   SqliteStatus status = openFresh(SqliteDatabase::Mode::readWrite);
-  // Acknowledgements make the log grow. The service empties it at 4000 pages, in the middle of a
-  // run. The forwarder does so much earlier, to spare the service the work.
   if (status.ok())
-    status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA wal_autocheckpoint=500");
+    status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA secure_delete=FAST");
   if (status.ok() &&
       !database_.integer("SELECT 1 FROM sqlite_schema WHERE name='forwarder_set_aside'")) {
     status = database_.execute(kTables);
   }
   if (status.ok()) status = prepareStatements();
-  if (status.ok()) counters_ = readForwarderCounters(database_).value_or(ForwarderCounters{});
-  return status;
+  if (!status.ok()) return status;
+  // Delivery goes on without the table, on a full disk for example.
+  delivered_.make();
+  readLimits();
+  sqlite3_wal_hook(database_.handle(), &ForwarderState::afterCommit, this);
+  counters_ = readForwarderCounters(database_).value_or(ForwarderCounters{});
+  return {};
 }
 
 SqliteStatus ForwarderState::openReadOnly() {
@@ -146,7 +145,10 @@ bool ForwarderState::isStillThere() const {
 }
 
 SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
-  for (SqliteStatement* statement : {&select_, &remove_, &keep_, &trim_, &count_}) *statement = {};
+  delivered_.close();
+  for (SqliteStatement* statement :
+       {&select_, &remove_, &keep_, &trim_, &count_, &pageCount_, &freePages_})
+    *statement = {};
   // close() would empty and delete the log by its name, and that may by now be the new spool's log.
   database_.abandon();
   struct stat facts {};
@@ -182,6 +184,7 @@ SqliteStatus ForwarderState::prepareStatements() {
           trim_,
           "DELETE FROM forwarder_set_aside WHERE id IN"
           " (SELECT id FROM forwarder_set_aside ORDER BY at DESC, id DESC LIMIT -1 OFFSET ?1)") &&
+      prepare(pageCount_, "PRAGMA page_count") && prepare(freePages_, "PRAGMA freelist_count") &&
       prepare(count_, "INSERT OR REPLACE INTO forwarder VALUES(?1, ?2)");
   return good ? SqliteStatus{} : database_.status();
 }
@@ -213,18 +216,58 @@ SqliteStatus ForwarderState::finish(bool good) {
   return status;
 }
 
-SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, uint64_t rejected,
+// The service may get other limits at any time, so they are read again at each look.
+void ForwarderState::readLimits() {
+  limits_ = readSpoolLimits(database_);
+  checkpointPages_ = checkpointPages(limits_.bytes);
+}
+
+// SQLite calls this after each commit, with the number of pages in the log. Like SQLite's own
+// automatic checkpoint, it waits for nobody.
+int ForwarderState::afterCommit(void* self, sqlite3* handle, const char* schema, int logPages) {
+  auto& state = *static_cast<ForwarderState*>(self);
+  state.logPages_ = logPages;
+  if (logPages >= std::min(kForwardersCheckpointPages, state.checkpointPages_))
+    sqlite3_wal_checkpoint_v2(handle, schema, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+  return SQLITE_OK;
+}
+
+// Whether a reader keeps the log from beginning anew. The checkpoint tells: it succeeds if the next
+// commit begins the log anew.
+bool ForwarderState::logIsHeld() {
+  if (logPages_ <= 2 * checkpointPages_) return false;
+  database_.setBusyTimeout(0);
+  const int code = sqlite3_wal_checkpoint_v2(database_.handle(), nullptr, SQLITE_CHECKPOINT_RESTART,
+                                             nullptr, nullptr);
+  database_.setBusyTimeout(kForwardersPatience);
+  if (code == SQLITE_OK) logPages_ = 0;
+  return code != SQLITE_OK;
+}
+
+// One row at least.
+ForwarderState::Rows ForwarderState::firstStep(Rows rows) const {
+  size_t count = 0;
+  uint64_t bytes = 0;
+  do {
+    bytes += spaceOfRow(rows[count]->name.size() + rows[count]->payload.size());
+    ++count;
+  } while (count < std::min(rows.size(), kRowsMovedAtOnce) && bytes < kBytesMovedAtOnce);
+  return rows.first(count);
+}
+
+SqliteStatus ForwarderState::acknowledge(Rows rows, uint64_t rejected, std::string_view destination,
                                          Date now) {
   const uint64_t deliveredBefore = counters_.delivered;
-  const size_t acknowledged = ids.size();
+  const size_t acknowledged = rows.size();
   counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
-  while (!ids.empty()) {
-    const auto step = ids.first(std::min(ids.size(), kRowsRemovedAtOnce));
+  while (!rows.empty()) {
+    const Rows step = firstStep(rows);
     // The rows of a step that fails are sent again, and the collector rejects its part of them
     // again. So a step counts no more of the rejected rows than it has.
     const uint64_t rejectedHere = std::min<uint64_t>(rejected, step.size());
-    if (SqliteStatus status = remove(step, rejectedHere); !status.ok()) return status;
-    ids = ids.subspan(step.size());
+    if (SqliteStatus status = move(step, rejectedHere, destination, now); !status.ok())
+      return status;
+    rows = rows.subspan(step.size());
     rejected -= rejectedHere;
   }
   // Each row was counted in one transaction, and in one only.
@@ -232,20 +275,68 @@ SqliteStatus ForwarderState::acknowledge(std::span<const int64_t> ids, uint64_t 
   return {};
 }
 
-SqliteStatus ForwarderState::remove(std::span<const int64_t> ids, uint64_t rejected) {
+// Copies are for people, and no event that waits is to wait for them. So none is kept where a
+// reader holds the log, which each copy would make longer, nor where keeping it fails: on a full
+// disk, or with a table that somebody has changed.
+SqliteStatus ForwarderState::move(Rows rows, uint64_t rejected, std::string_view destination,
+                                  Date now) {
+  if (!delivered_.isOpen() || logIsHeld())
+    return moveOnce(rows, rejected, destination, now, Delivered::dropped);
+  SqliteStatus status = moveOnce(rows, rejected, destination, now, Delivered::kept);
+  // With these errors the disk or another client is at fault, and not the copy.
+  const int code = status.primaryCode();
+  if (status.ok() || code == SQLITE_BUSY || code == SQLITE_IOERR) return status;
+  delivered_.close();  // until the next look
+  return moveOnce(rows, rejected, destination, now, Delivered::dropped);
+}
+
+SqliteStatus ForwarderState::moveOnce(Rows rows, uint64_t rejected, std::string_view destination,
+                                      Date now, Delivered fate) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
-  counters_.delivered += ids.size();
+  counters_.delivered += rows.size();
   counters_.rejected += rejected;
   // Requeued rows have ids below the position. The maximum keeps it from going back.
-  counters_.position = std::max(counters_.position, static_cast<uint64_t>(ids.back()));
-  SqliteStatus status =
-      finish(std::all_of(ids.begin(), ids.end(),
-                         [this](int64_t id) { return remove_.bind(1, id).run(); }) &&
-             writeCounters());
+  counters_.position = std::max(counters_.position, static_cast<uint64_t>(rows.back()->id));
+  std::vector<const SpooledEvent*> removed;
+  bool good = std::all_of(rows.begin(), rows.end(), [&](const SpooledEvent* row) {
+    const bool done = remove_.bind(1, row->id).run();
+    // Another forwarder may have delivered it as well. It then has the copy.
+    if (database_.changes() == 1) removed.push_back(row);
+    return done;
+  });
+  if (good && fate == Delivered::kept) good = keep(removed, destination, now);
+  SqliteStatus status = finish(good && writeCounters());
   // The rollback has kept the rows, so they must not count as delivered.
   if (!status.ok()) counters_ = before;
   return status;
+}
+
+bool ForwarderState::keep(Rows rows, std::string_view destination, Date now) {
+  const uint64_t before = delivered_.bytes();
+  return delivered_.add(rows, destination, now) && shortenBy(delivered_.bytes() - before);
+}
+
+// Removes what is over the limits, but not much more than what was added: the lock is held for as
+// long as it takes, and each later transaction does its part.
+bool ForwarderState::shortenBy(uint64_t added) {
+  const uint64_t bytes = delivered_.bytes();
+  const auto used =
+      static_cast<uint64_t>((pageCount_.value() - freePages_.value()) * kSpoolPageBytes);
+  const uint64_t allowed = DeliveredRows::allowance(limits_, used - std::min(used, bytes));
+  if (bytes <= allowed) return true;
+  return delivered_.removeOldest(std::min(bytes - allowed, added + kBytesMovedAtOnce)).has_value();
+}
+
+void ForwarderState::shortenDelivered(Date now) {
+  // Whoever may write to the spool can change the table, so it is looked at again.
+  delivered_.close();
+  if (!delivered_.open()) return;
+  readLimits();
+  DeliveredRows::Search search = DeliveredRows::searchAt(now, limits_, kRowsLookedAt);
+  while (delivered_.removeExpired(search)) continue;
+  for (uint64_t before = delivered_.bytes(); shortenBy(0) && delivered_.bytes() < before;)
+    before = delivered_.bytes();
 }
 
 SqliteStatus ForwarderState::setAside(const SpooledEvent& event, int64_t collectorStatus,

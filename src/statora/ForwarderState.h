@@ -1,8 +1,9 @@
 // The spool as the forwarder sees it, and what the forwarder keeps in it.
 //
-// A row stays in `events` until a collector has taken it. The forwarder adds two tables:
+// A row stays in `events` until a collector has taken it. The forwarder adds three tables:
 //
 //   forwarder            name and value of each counter
+//   forwarder_delivered  the rows that a collector has taken lately, see SpoolRows.h
 //   forwarder_set_aside  the rows that cannot be delivered, each with the time of the refusal and
 //                        the collector's status and words (status 0: no collector was asked)
 //
@@ -18,26 +19,10 @@
 #include <vector>
 
 #include "platform/System.h"
+#include "statora/SpoolRows.h"
 #include "statora/Sqlite.h"
 
 namespace tessel {
-
-struct SpooledEvent {
-  int64_t id = 0;
-  int64_t time = 0;  // microseconds since 1970
-  std::string name;
-  std::string payload;  // a JSON object, unless somebody tampered with the spool
-};
-
-// The oldest rows with an id above `after`: up to `maxRows` rows, or until they hold `maxBytes`,
-// but one row at least. `select` is a prepared kSelectEvents. It is closed again before this
-// returns, because no checkpoint can empty the log while a statement stands open. So whoever prints
-// or sends rows does that between two calls. After an error the rows before it are answered, and
-// the status of the database has the reason.
-std::vector<SpooledEvent> readEvents(SqliteStatement& select, int64_t after, size_t maxRows,
-                                     size_t maxBytes);
-inline constexpr char kSelectEvents[] =
-    "SELECT id, time, name, payload FROM events WHERE id > ?1 ORDER BY id LIMIT ?2";
 
 // What the forwarder has done with this spool since the spool was made.
 struct ForwarderCounters {
@@ -83,10 +68,14 @@ class ForwarderState {
 
   // The counters. The next acknowledgement or setting aside stores them.
   ForwarderCounters& counters() { return counters_; }
-  // Counts the rows as delivered and removes them, in transactions of a few rows each. `rejected`
-  // of them were thrown away by the collector, which does not say which. If it fails, the rows of
-  // the finished transactions are gone and counted, and the others wait. `ids` ascend.
-  SqliteStatus acknowledge(std::span<const int64_t> ids, uint64_t rejected, Date now);
+  // Counts the rows as delivered to `destination` and moves them to the delivered ones, in
+  // transactions of a few rows each. `rejected` of them were thrown away by the collector, which
+  // does not say which. If it fails, the rows of the finished transactions are moved and counted,
+  // and the others wait. The ids of `rows` ascend.
+  SqliteStatus acknowledge(std::span<const SpooledEvent* const> rows, uint64_t rejected,
+                           std::string_view destination, Date now);
+  // Removes delivered rows that are past their days, or more than the limits allow.
+  void shortenDelivered(Date now);
   // Moves a row to the table of refused rows, with the collector's answer. If the table then has
   // more rows than the limit, its oldest row is deleted.
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
@@ -104,7 +93,19 @@ class ForwarderState {
   SqliteStatus openAndPrepare();
   SqliteStatus prepareStatements();
   bool isStillThere() const;
-  SqliteStatus remove(std::span<const int64_t> ids, uint64_t rejected);
+  // What happens to rows that are delivered.
+  enum class Delivered { kept, dropped };
+  using Rows = std::span<const SpooledEvent* const>;
+
+  Rows firstStep(Rows rows) const;
+  SqliteStatus move(Rows rows, uint64_t rejected, std::string_view destination, Date now);
+  SqliteStatus moveOnce(Rows rows, uint64_t rejected, std::string_view destination, Date now,
+                        Delivered fate);
+  bool keep(Rows rows, std::string_view destination, Date now);
+  bool shortenBy(uint64_t added);
+  bool logIsHeld();
+  void readLimits();
+  static int afterCommit(void* self, sqlite3* handle, const char* schema, int logPages);
   bool writeCounters();
   SqliteStatus finish(bool good);
 
@@ -115,7 +116,11 @@ class ForwarderState {
   uint64_t inode_ = 0;
   std::string spoolId_;
   ForwarderCounters counters_;
-  SqliteStatement select_, remove_, keep_, trim_, count_;
+  SqliteStatement select_, remove_, keep_, trim_, count_, pageCount_, freePages_;
+  DeliveredRows delivered_{database_};
+  SpoolLimits limits_;
+  int64_t checkpointPages_ = 0;
+  int64_t logPages_ = 0;  // after the last commit of this program
 };
 
 }  // namespace tessel

@@ -28,28 +28,14 @@
 #include <filesystem>
 #include <limits>
 #include <utility>
-#include <vector>
 
 namespace tessel {
 
 namespace {
 
-constexpr int64_t kPageBytes = 4096;
-// What SQLite stores beside the text of a row: id, time, lengths, and the row's place in its page.
-constexpr uint64_t kBytesBesideText = 24;
-// Bytes of rows in a page of a table, and in a page that continues a long row.
-constexpr uint64_t kRowBytesInPage = kPageBytes - 12;
-constexpr uint64_t kRowBytesInOverflowPage = kPageBytes - 4;
 // Pages that an insert may write beside those of the row: where a page of the tree is split, and
 // the table that remembers the last id.
 constexpr int64_t kPagesBesideRow = 3;
-
-// A checkpoint costs three flushes, so it comes once in 16 MiB of log. Every reader looks through
-// the log, so a much longer one would slow the readers down.
-constexpr int64_t kCheckpointPages = 4000;
-// A spool with a small limit must not spend all of it on the log.
-constexpr int64_t kLeastCheckpointPages = 16;
-constexpr int64_t kLogShare = 32;
 
 // The patience of one insert. The rows wait in memory and are tried again each second, so a long
 // wait would win nothing.
@@ -59,9 +45,12 @@ constexpr std::chrono::milliseconds kPatience{250};
 // each.
 constexpr int64_t kRowsExpiredAtOnce = 32;
 constexpr int kPagesVacuumedAtOnce = 256;
+// Pages of delivered rows that are cleared at once: some more than a transaction of usual rows
+// needs, so that few transactions have to clear any, and few enough for a log that cannot grow.
+constexpr int64_t kPagesClearedAtOnce = 32;
 // Rows stand in the order of sending. Where the clock was set, old rows may stand behind newer
 // ones, so the search goes on for so many rows. To read the whole spool would take seconds.
-constexpr size_t kNewerRowsLookedAt = 16384;
+constexpr int64_t kNewerRowsLookedAt = 16384;
 
 // A run may take an eighth of what is free when it begins. So each run that floods the spool leaves
 // seven eighths of what it has found to the next one. The price is that a run's part shrinks: after
@@ -94,28 +83,14 @@ int64_t pagesForObjects(int64_t pagesOfRun) {
   return pagesOfRun - pagesKeptFrom(EventRank::object, pagesOfRun);
 }
 
-int64_t valueOf(SqliteStatement& statement) {
-  const bool read = statement.step() == SqliteStatement::Step::row;
-  const int64_t value = read ? statement.integer(0) : 0;
-  statement.reset();
-  return value;
-}
-
 }  // namespace
-
-uint64_t spaceOfRow(size_t textBytes) {
-  const uint64_t bytes = textBytes + kBytesBesideText;
-  if (bytes <= kRowBytesInPage) return kPageBytes / (kRowBytesInPage / bytes);
-  return (bytes / kRowBytesInOverflowPage + 1) * kPageBytes;
-}
 
 SpoolDatabase::SpoolDatabase(std::string stateDirectory, SpoolLimits limits)
     : directory_(std::move(stateDirectory)),
       path_(directory_ + "/" + kSpoolFileName),
       limits_(limits),
-      maxPages_(static_cast<int64_t>(limits.bytes) / kPageBytes),
-      checkpointPages_(
-          std::clamp<int64_t>(maxPages_ / kLogShare, kLeastCheckpointPages, kCheckpointPages)),
+      maxPages_(static_cast<int64_t>(limits.bytes) / kSpoolPageBytes),
+      checkpointPages_(checkpointPages(limits.bytes)),
       patience_(kPatience) {}
 
 bool SpoolDatabase::exists() const {
@@ -141,8 +116,8 @@ void SpoolDatabase::endRun() {
 int64_t SpoolDatabase::pagesOfRun() {
   if (pagesOfRun_ != 0) return pagesOfRun_;
   if (exists()) ensureOpen();
-  const int64_t used = isOpen() ? valueOf(pageCount_) - valueOf(freePages_) : 0;
-  pagesOfRun_ = shareOf(maxPages_ - 2 * checkpointPages_ - used);
+  const int64_t waiting = isOpen() ? usedPages() - deliveredPages() : 0;
+  pagesOfRun_ = shareOf(maxPages_ - 2 * checkpointPages_ - waiting);
   return pagesOfRun_;
 }
 
@@ -151,7 +126,7 @@ int64_t SpoolDatabase::pagesOfRun() {
 uint64_t SpoolDatabase::bytesForObjects() {
   const int64_t pages = pagesForObjects(pagesOfRun());
   const int64_t ofEmpty = pagesForObjects(shareOf(maxPages_ - 2 * checkpointPages_));
-  return static_cast<uint64_t>((pages > 0 ? pages : ofEmpty) * kPageBytes);
+  return static_cast<uint64_t>((pages > 0 ? pages : ofEmpty) * kSpoolPageBytes);
 }
 
 SqliteStatus SpoolDatabase::ensureOpen() {
@@ -171,7 +146,7 @@ SqliteStatus SpoolDatabase::open() {
   if (!status.ok()) return status;
   // journal_size_limit cuts the log's file down after a reader let it grow.
   status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA journal_size_limit=" +
-                             std::to_string(checkpointPages_ * kPageBytes));
+                             std::to_string(checkpointPages_ * kSpoolPageBytes));
   if (!status.ok()) return status;
   logPages_ = 0;
   nextCheckpoint_ = checkpointPages_;
@@ -183,11 +158,15 @@ SqliteStatus SpoolDatabase::open() {
   pageCount_ = database_.prepare("PRAGMA page_count", true);
   freePages_ = database_.prepare("PRAGMA freelist_count", true);
   insert_ = database_.prepare("INSERT INTO events(time, name, payload) VALUES(?1, ?2, ?3)", true);
-  const bool good = pageCount_.prepared() && freePages_.prepared();
-  return good && insert_.prepared() ? SqliteStatus{} : database_.status();
+  delivered_.open();
+  // If this fails, the forwarder keeps to the limits that stand there, or to the least ones.
+  writeSpoolLimits(database_, limits_);
+  const bool good = pageCount_.prepared() && freePages_.prepared() && insert_.prepared();
+  return good ? SqliteStatus{} : database_.status();
 }
 
 void SpoolDatabase::forgetStatements() {
+  delivered_.close();
   for (SqliteStatement* statement : {&insert_, &pageCount_, &freePages_}) *statement = {};
 }
 
@@ -198,7 +177,21 @@ void SpoolDatabase::close() {
   unflushedRows_ = 0;
 }
 
+int64_t SpoolDatabase::usedPages() { return pageCount_.value() - freePages_.value(); }
+
+int64_t SpoolDatabase::deliveredPages() {
+  return static_cast<int64_t>(delivered_.bytes()) / kSpoolPageBytes;
+}
+
+// On a full disk the delivered rows go first. Each round gives a little of their space back to the
+// file system and inserts the same rows again.
 SqliteStatus SpoolDatabase::insert(std::span<PendingRow> rows) {
+  SqliteStatus status = insertOnce(rows);
+  while (status.primaryCode() == SQLITE_FULL && clearDisk()) status = insertOnce(rows);
+  return status;
+}
+
+SqliteStatus SpoolDatabase::insertOnce(std::span<PendingRow> rows) {
   if (SqliteStatus opened = ensureOpen(); !opened.ok()) return opened;
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const uint64_t takenBefore = takenByRun_;
@@ -216,9 +209,23 @@ SqliteStatus SpoolDatabase::insert(std::span<PendingRow> rows) {
   return {};
 }
 
+// A removal needs room in the log, which cannot grow. So the log begins anew, in the blocks that it
+// has, and the step is a small one.
+bool SpoolDatabase::clearDisk() {
+  if (!isOpen() || !delivered_.open()) return false;
+  checkpoint();
+  if (delivered_.removeOldest(kPagesClearedAtOnce * kSpoolPageBytes).value_or(0) == 0) return false;
+  giveSpaceBack([] {});
+  checkpoint();  // it shortens the file
+  return true;
+}
+
 SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
   for (PendingRow& row : rows) {
-    row.refused = refusal(row);
+    row.refused = overShare(row);
+    if (row.refused) continue;
+    if (SqliteStatus made = makeRoom(row); !made.ok()) return made;
+    row.refused = overLimit(row);
     if (row.refused) continue;
     insert_.bind(1, row.time).bind(2, row.name).bind(3, *row.payload);
     if (!insert_.run()) return database_.status();
@@ -227,26 +234,50 @@ SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {
   return {};
 }
 
-// The limit holds for the pages in use and the log together. A reader that stays makes the log grow
-// although its pages will also go into the database, so both are counted. Twice the usual log is
-// never given to rows: the log needs it between two checkpoints.
-std::optional<SpoolFailure> SpoolDatabase::refusal(const PendingRow& row) {
-  const uint64_t space = spaceOfRow(row.textBytes());
+std::optional<SpoolFailure> SpoolDatabase::overShare(const PendingRow& row) {
   const int64_t kept = pagesKeptFrom(row.rank, pagesOfRun());
   if (row.rank == EventRank::object && pagesForObjects(pagesOfRun()) == 0)
     return SpoolFailure::limit;
   if (row.rank != EventRank::statistics &&
-      takenByRun_ + space > static_cast<uint64_t>((pagesOfRun() - kept) * kPageBytes)) {
+      takenByRun_ + spaceOfRow(row.textBytes()) >
+          static_cast<uint64_t>((pagesOfRun() - kept) * kSpoolPageBytes)) {
     return SpoolFailure::runShare;
   }
-  const int64_t needed = static_cast<int64_t>(space) / kPageBytes + kPagesBesideRow;
-  const int64_t room = maxPages_ - (valueOf(pageCount_) - valueOf(freePages_)) - kept - needed;
-  if (room < 2 * checkpointPages_) return SpoolFailure::limit;
-  if (logIsHeld() && room < logPages_ + pagesOfInsert_ + needed) {
+  return {};
+}
+
+// The limit holds for the pages in use and the log together. A reader that stays makes the log grow
+// although its pages will also go into the database, so both are counted. Twice the usual log is
+// never given to rows: the log needs it between two checkpoints.
+SpoolDatabase::Room SpoolDatabase::roomFor(const PendingRow& row) {
+  Room room;
+  room.row = static_cast<int64_t>(spaceOfRow(row.textBytes())) / kSpoolPageBytes + kPagesBesideRow;
+  room.left = maxPages_ - usedPages() - pagesKeptFrom(row.rank, pagesOfRun()) - room.row;
+  room.log = 2 * checkpointPages_;
+  if (logIsHeld()) room.log = std::max(room.log, logPages_ + pagesOfInsert_ + room.row);
+  return room;
+}
+
+// Delivered rows give way to a new one. The pages that they leave are cleared in the log.
+SqliteStatus SpoolDatabase::makeRoom(const PendingRow& row) {
+  for (Room room = roomFor(row); room.left < room.log && delivered_.open(); room = roomFor(row)) {
+    const int64_t pages = std::max(room.log - room.left, kPagesClearedAtOnce);
+    const auto removed = delivered_.removeOldest(static_cast<uint64_t>(pages * kSpoolPageBytes));
+    if (!removed) return database_.status();
+    if (*removed == 0) break;
+    pagesOfInsert_ += pages;
+  }
+  return {};
+}
+
+std::optional<SpoolFailure> SpoolDatabase::overLimit(const PendingRow& row) {
+  const Room room = roomFor(row);
+  if (room.left < 2 * checkpointPages_) return SpoolFailure::limit;
+  if (room.left < room.log) {
     refusedForLog_ = true;
     return SpoolFailure::heldByReader;
   }
-  pagesOfInsert_ += needed;
+  pagesOfInsert_ += room.row;
   return {};
 }
 
@@ -293,20 +324,35 @@ SqliteStatus SpoolDatabase::flush() {
 uint64_t SpoolDatabase::takeRowsAtRisk() { return std::exchange(rowsAtRisk_, 0); }
 
 bool SpoolDatabase::mayGrowLog() {
-  return !logIsHeld() || valueOf(pageCount_) + logPages_ + 2 * checkpointPages_ < maxPages_;
+  return !logIsHeld() || pageCount_.value() + logPages_ + 2 * checkpointPages_ < maxPages_;
 }
 
 uint64_t SpoolDatabase::expire(Date now, const std::function<void()>& progress) {
   if (!exists() || !ensureOpen().ok()) return 0;
+  const auto repeat = [&](const auto& removeSome) {
+    while (mayGrowLog() && removeSome()) {
+      if (logPages_ >= nextCheckpoint_) checkpoint();
+      progress();
+    }
+  };
   uint64_t removed = 0;
   if (limits_.days.count() != 0) {
-    const int64_t oldest = (now - limits_.days).time_since_epoch().count();
-    Search search{.oldest = oldest};
-    while (search.newerRows < kNewerRowsLookedAt && mayGrowLog() && expireNext(search)) progress();
+    Search search{.oldest = (now - limits_.days).time_since_epoch().count()};
+    repeat([&] { return expireNext(search); });
     removed = search.removed;
   }
+  DeliveredRows::Search search = DeliveredRows::searchAt(now, limits_, -1);
+  repeat([&] { return delivered_.removeExpired(search); });
+  repeat([&] {
+    return deliveredTooMuch() && delivered_.removeOldest(kPagesClearedAtOnce * kSpoolPageBytes);
+  });
   giveSpaceBack(progress);
   return removed;
+}
+
+bool SpoolDatabase::deliveredTooMuch() {
+  const auto others = static_cast<uint64_t>((usedPages() - deliveredPages()) * kSpoolPageBytes);
+  return delivered_.bytes() > DeliveredRows::allowance(limits_, others);
 }
 
 // SQLite uses free pages again, but shortens the file only when asked. A VACUUM would copy the
@@ -316,8 +362,8 @@ void SpoolDatabase::giveSpaceBack(const std::function<void()>& progress) {
   const std::string step =
       "PRAGMA incremental_vacuum(" + std::to_string(kPagesVacuumedAtOnce) + ")";
   int64_t before = std::numeric_limits<int64_t>::max();
-  for (int64_t free = valueOf(freePages_); free > 0 && free < before && mayGrowLog();
-       free = valueOf(freePages_)) {
+  for (int64_t free = freePages_.value(); free > 0 && free < before && mayGrowLog();
+       free = freePages_.value()) {
     before = free;
     if (!database_.execute(step).ok()) return;
     if (logPages_ >= nextCheckpoint_) checkpoint();
@@ -325,44 +371,22 @@ void SpoolDatabase::giveSpaceBack(const std::function<void()>& progress) {
   }
 }
 
-// Looks at the next rows and removes the old ones among them. False at the end of the table, and
-// where it fails.
+// False if there are no more old rows, or if it fails.
 bool SpoolDatabase::expireNext(Search& search) {
-  std::vector<int64_t> old;
-  size_t seen = 0;
-  SqliteStatement look = database_.prepare(
-      "SELECT id, time FROM events WHERE id > ?1 AND id < ?2 ORDER BY id LIMIT ?3");
-  if (!look.prepared()) return false;
-  look.bind(1, search.after).bind(2, firstIdOfRun_).bind(3, kRowsExpiredAtOnce);
-  for (; look.step() == SqliteStatement::Step::row; ++seen) {
-    search.after = look.integer(0);
-    if (look.integer(1) < search.oldest) old.push_back(search.after);
-  }
-  // The statement would hold a read open while we write, and the log could not begin anew.
-  look = {};
-  search.newerRows = old.empty() ? search.newerRows + seen : 0;
-  if (!old.empty()) {
-    const std::optional<int64_t> removed = remove(old);
-    if (!removed) return false;
-    search.removed += static_cast<uint64_t>(*removed);
-  }
-  return seen != 0;
-}
-
-// Answers how many of the rows were still there.
-std::optional<int64_t> SpoolDatabase::remove(std::span<const int64_t> ids) {
-  SqliteStatement remove = database_.prepare("DELETE FROM events WHERE id=?1");
-  if (!remove.prepared() || !database_.execute("BEGIN IMMEDIATE").ok()) return {};
-  int64_t removed = 0;
-  bool good = std::all_of(ids.begin(), ids.end(), [&](int64_t id) {
-    const bool done = remove.bind(1, id).run();
-    removed += database_.changes();  // the forwarder may have removed it meanwhile
-    return done;
-  });
-  good = good && database_.execute("COMMIT").ok();
-  if (!good) database_.execute("ROLLBACK");
-  if (logPages_ >= nextCheckpoint_) checkpoint();
-  return good ? std::optional(removed) : std::nullopt;
+  SqliteStatement find = database_.prepare(
+      "SELECT id FROM (SELECT id, time FROM events WHERE id >= ?1 AND id < ?2 ORDER BY id LIMIT ?3)"
+      " WHERE time < ?4 LIMIT 1");
+  SqliteStatement remove =
+      database_.prepare("DELETE FROM events WHERE id BETWEEN ?1 AND ?2 AND time < ?3");
+  if (!find.prepared() || !remove.prepared()) return false;
+  find.bind(1, search.from).bind(2, firstIdOfRun_).bind(3, kNewerRowsLookedAt);
+  const int64_t found = find.bind(4, search.oldest).value();
+  if (found == 0) return false;
+  search.from = std::min(found + kRowsExpiredAtOnce, firstIdOfRun_);
+  if (!remove.bind(1, found).bind(2, search.from - 1).bind(3, search.oldest).run()) return false;
+  // The forwarder may have removed some of them meanwhile.
+  search.removed += static_cast<uint64_t>(database_.changes());
+  return true;
 }
 
 // abandon() and not close(): a checkpoint would write into the damaged file.

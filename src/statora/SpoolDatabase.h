@@ -17,18 +17,10 @@
 #include "platform/Analytics.h"
 #include "platform/System.h"
 #include "statora/SpoolFile.h"
+#include "statora/SpoolRows.h"
 #include "statora/Sqlite.h"
 
 namespace tessel {
-
-struct SpoolLimits {
-  uint64_t bytes = uint64_t{1} << 30;  // of the database and its write-ahead log together
-  std::chrono::days days{30};          // how long a row may stay; zero: for ever
-};
-
-// Bytes of pages that rows of this length take one after another. A page holds as many short rows
-// as fit; a long row has pages of its own.
-uint64_t spaceOfRow(size_t textBytes);
 
 // A row on its way into the spool. The two events of an object share one payload.
 struct PendingRow {
@@ -82,21 +74,34 @@ class SpoolDatabase {
 
  private:
   struct Search {
-    int64_t oldest = 0;    // microseconds since 1970; a row of an earlier time is removed
-    int64_t after = 0;     // id of the last row looked at
-    size_t newerRows = 0;  // looked at since the last old one
+    int64_t oldest = 0;  // microseconds since 1970; a row of an earlier time is removed
+    int64_t from = 0;    // id of the next row to look at
     uint64_t removed = 0;
+  };
+
+  // Pages for one row.
+  struct Room {
+    int64_t row = 0;   // that it may need
+    int64_t left = 0;  // that are left when it has taken them
+    int64_t log = 0;   // that must be left, for the log
   };
 
   SqliteStatus ensureOpen();
   SqliteStatus open();
   void forgetStatements();
+  SqliteStatus insertOnce(std::span<PendingRow> rows);
   SqliteStatus insertEach(std::span<PendingRow> rows);
+  bool clearDisk();
   int64_t pagesOfRun();
-  std::optional<SpoolFailure> refusal(const PendingRow& row);
+  int64_t usedPages();
+  int64_t deliveredPages();
+  std::optional<SpoolFailure> overShare(const PendingRow& row);
+  Room roomFor(const PendingRow& row);
+  SqliteStatus makeRoom(const PendingRow& row);
+  std::optional<SpoolFailure> overLimit(const PendingRow& row);
   void checkpoint();
   bool expireNext(Search& search);
-  std::optional<int64_t> remove(std::span<const int64_t> ids);
+  bool deliveredTooMuch();
   void giveSpaceBack(const std::function<void()>& progress);
   bool mayGrowLog();
   static int afterCommit(void* self, sqlite3* handle, const char* schema, int logPages);
@@ -109,6 +114,7 @@ class SpoolDatabase {
 
   SqliteDatabase database_;
   SqliteStatement insert_, pageCount_, freePages_;
+  DeliveredRows delivered_{database_};
   std::chrono::milliseconds patience_;
   int64_t firstIdOfRun_ = 0;    // 0 until the run has opened the database
   int64_t pagesOfRun_ = 0;      // that the run may take; 0 until it is fixed

@@ -64,6 +64,12 @@ bool SqliteStatement::run() {
   return result == Step::done;
 }
 
+int64_t SqliteStatement::value(int column) {
+  const int64_t found = step() == Step::row ? integer(column) : 0;
+  reset();
+  return found;
+}
+
 int64_t SqliteStatement::integer(int column) const {
   return sqlite3_column_int64(statement_.get(), column);
 }

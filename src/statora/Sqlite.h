@@ -42,6 +42,8 @@ class SqliteStatement {
   void reset();
   // Executes the statement from beginning to end and drops its rows. False if it failed.
   bool run();
+  // Executes the statement and answers a column of its first row; 0 if there is none.
+  int64_t value(int column = 0);
 
   // Columns count from 0. Text is valid until the next step() or reset().
   int64_t integer(int column) const;

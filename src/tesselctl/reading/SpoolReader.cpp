@@ -10,6 +10,7 @@
 #include <sqlite3.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "os/Files.h"
@@ -147,6 +148,15 @@ std::optional<SpoolContents> SpoolReader::contents() {
     contents.newest = database_.integer("SELECT time FROM events ORDER BY id DESC LIMIT 1");
   }
   contents.forwarder = readForwarderCounters(database_);
+  DeliveredRows delivered(database_);
+  delivered.open();
+  const int64_t pages = database_.integer("PRAGMA page_count").value_or(0) -
+                        database_.integer("PRAGMA freelist_count").value_or(0);
+  const auto used = static_cast<uint64_t>(pages * kSpoolPageBytes);
+  contents.bytesOfWaiting = used - std::min(used, delivered.bytes());
+  contents.delivered = database_.integer("SELECT count(*) FROM forwarder_delivered").value_or(0);
+  if (const auto limit = database_.integer("SELECT value FROM meta WHERE key='limit_bytes'"))
+    contents.limit = static_cast<uint64_t>(*limit);
   return contents;
 }
 

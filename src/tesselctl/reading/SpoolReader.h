@@ -23,7 +23,12 @@ struct SpoolContents {
   int64_t rows = 0;
   std::optional<int64_t> oldest;  // microseconds since 1970; absent where it is empty
   std::optional<int64_t> newest;
-  uint64_t bytes = 0;                          // database and write-ahead log
+  uint64_t bytes = 0;  // database and write-ahead log
+  // Of the database, what new rows cannot have. Delivered rows and free pages give way to them, so
+  // these do not count.
+  uint64_t bytesOfWaiting = 0;
+  std::optional<uint64_t> limit;  // the service's TESSEL_SPOOL_LIMIT; absent until a run has sent
+  int64_t delivered = 0;          // rows that a collector took and that are still here
   std::optional<ForwarderCounters> forwarder;  // absent where none ever worked on it
 };
 
