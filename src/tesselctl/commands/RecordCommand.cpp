@@ -58,8 +58,6 @@ struct OriginOptions {
   std::optional<uint64_t> at, monotonic;
   std::optional<double> ago;
   std::optional<std::string> imagePath, processName, process, boot;
-
-  bool any() const { return at || monotonic || ago || imagePath || processName || process || boot; }
 };
 
 struct RecordOptions {
@@ -110,10 +108,6 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
 // Absent where the point was recorded, or recording is off.
 std::optional<Failure> record(const RecordOptions& options, const RecordedPoint& point) {
   if (!recordingEnabled()) return std::nullopt;
-  if (!options.store && options.origin.any()) {
-    return Failure{kUsage,
-                   "--at, --ago, --monotonic, --boot, --exe, --comm and --pid need --store"};
-  }
   auto fields = fieldsOf(point);
   if (auto* complaint = std::get_if<std::string>(&fields)) return Failure{kUsage, *complaint};
   const auto& list = std::get<std::vector<RecordedField>>(fields);
@@ -236,12 +230,15 @@ void addPointOptions(CLI::App& app, RecordedPoint& point) {
 void addStoreOptions(CLI::App& app, RecordOptions& options) {
   const std::string group = "With --store, in place of what is true";
   OriginOptions& origin = options.origin;
-  app.add_option("--store", options.store,
-                 "Append to an .export file in this directory, which must exist, instead of the "
-                 "journal; for machines without a journal, and for trying things out")
-      ->type_name("DIR");
+  auto* store =
+      app.add_option(
+             "--store", options.store,
+             "Append to an .export file in this directory, which must exist, instead of the "
+             "journal; for machines without a journal, and for trying things out")
+          ->type_name("DIR");
+  // To the journal, the daemon itself gives these facts, and nobody can replace them.
   const auto add = [&](const char* name, auto& value, const char* type, const char* help) {
-    return app.add_option(name, value, help)->type_name(type)->group(group);
+    return app.add_option(name, value, help)->type_name(type)->group(group)->needs(store);
   };
   auto* at = add("--at", origin.at, "MICROSECONDS", "Time of the entry, since 1970");
   add("--ago", origin.ago, "SECONDS", "Time of the entry, before now")

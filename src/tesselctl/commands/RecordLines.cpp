@@ -148,6 +148,8 @@ const char* takePairs(RecordedPoint& point, const json& value) {
   return nullptr;
 }
 
+// A key that nobody knows is an error and not passed over: a misspelt one would lose its value
+// without a word.
 struct JsonKey {
   std::string_view name;
   TakeValue take;
@@ -176,6 +178,8 @@ constexpr JsonKey kKeys[] = {
 
 std::variant<RecordedPoint, std::string> pointFrom(std::string_view line,
                                                    const RecordedPoint& defaults) {
+  // The parser throws, also for a number that no double can hold. No exception may leave this room,
+  // and the place in the line is all that helps to find the mistake.
   json object;
   try {
     object = json::parse(line);
@@ -200,6 +204,7 @@ ExitStatus recordLines(int fd, const RecordedPoint& defaults, const RecordPoint&
   LineReader lines(fd);
   uint64_t points = 0;
   uint64_t missing = 0;
+  // A line that is wrong outranks one that was lost: it will be wrong again when it is sent again.
   ExitStatus status = kDone;
   std::string lastFailure;
   while (const auto line = lines.next()) {
