@@ -6,6 +6,8 @@
 
 #include "platform/Text.h"
 
+#include <algorithm>
+
 namespace tessel {
 
 namespace {
@@ -40,6 +42,41 @@ void appendByteEscapes(std::string& out, std::string_view bytes) {
     out += kDigits[byteAt(bytes, at) >> 4];
     out += kDigits[byteAt(bytes, at) & 0xf];
   }
+}
+
+// [U+200B], with at least four digits as Unicode writes them.
+void appendNumber(std::string& out, char32_t point) {
+  constexpr std::string_view kDigits = "0123456789ABCDEF";
+  out += "[U+";
+  for (int shift = 20; shift >= 0; shift -= 4) {
+    if (shift < 16 || point >> shift != 0) out += kDigits[(point >> shift) & 0xf];
+  }
+  out += "]";
+}
+
+struct Range {
+  char32_t first;
+  char32_t last;
+};
+
+// The characters that Unicode lets a font leave out, those that format their neighbours, and the
+// blanks that look like U+0020 or like nothing. No library may be asked in this room, so they stand
+// here.
+constexpr Range kUnseen[] = {
+    {0x00a0, 0x00a0},   {0x00ad, 0x00ad},   {0x034f, 0x034f},   {0x061c, 0x061c},
+    {0x115f, 0x1160},   {0x1680, 0x1680},   {0x17b4, 0x17b5},   {0x180b, 0x180f},
+    {0x2000, 0x200f},   {0x2028, 0x202f},   {0x205f, 0x206f},   {0x2800, 0x2800},
+    {0x3000, 0x3000},   {0x3164, 0x3164},   {0xfe00, 0xfe0f},   {0xfeff, 0xfeff},
+    {0xffa0, 0xffa0},   {0xfff0, 0xfffb},   {0x13430, 0x1343f}, {0x1bca0, 0x1bca3},
+    {0x1d173, 0x1d17a}, {0xe0000, 0xe0fff},
+};
+
+bool isUnseen(char32_t point) {
+  if (isControl(point)) return true;
+  // Almost every character is below the first range.
+  if (point < kUnseen[0].first) return false;
+  return std::ranges::any_of(
+      kUnseen, [point](const Range& range) { return point >= range.first && point <= range.last; });
 }
 
 std::string_view markupFor(char32_t point) {
@@ -164,26 +201,36 @@ std::string shortPlainText(std::string_view text, size_t maximum) {
   return plain.substr(0, head).append(kLeftOut).append(plain, tail);
 }
 
-// HTML forbids most controls, even as a numeric reference. Unicode has a visible picture for each
-// control below U+0020, at U+2400 plus its number, so we show that. DEL and the C1 controls become
-// U+FFFD.
-std::string htmlText(std::string_view text) {
-  constexpr uint32_t kControlPictures = 0x2400;
+// Two names that look the same may differ by a character that nobody sees, and a whole sentence can
+// hide in characters of the tags block. A control below U+0020 has a picture in Unicode, at U+2400
+// plus its number. The others have none, so we show their numbers.
+std::string visibleText(std::string_view text) {
+  constexpr char32_t kControlPictures = 0x2400;
   std::string out;
   out.reserve(text.size());
   appendEscaped(
       out, text,
-      [](const Character& character) {
-        return character.valid && !isObeyed(character.point) && markupFor(character.point).empty();
-      },
+      [](const Character& character) { return character.valid && !isUnseen(character.point); },
       [&](const Character& character) {
-        if (character.point < 0x20)
-          out += "&#" + std::to_string(kControlPictures + character.point) + ";";
-        else if (isObeyed(character.point) || !character.valid)
+        if (!character.valid) {
           out += kReplacementCharacter;
-        else
-          out += markupFor(character.point);
+        } else if (character.point < 0x20) {
+          const char32_t picture = kControlPictures + character.point;
+          out += {'\xe2', '\x90', static_cast<char>(0x80 | (picture & 0x3f))};
+        } else {
+          appendNumber(out, character.point);
+        }
       });
+  return out;
+}
+
+std::string htmlText(std::string_view text) {
+  const std::string visible = visibleText(text);
+  std::string out;
+  out.reserve(visible.size());
+  appendEscaped(
+      out, visible, [](const Character& character) { return markupFor(character.point).empty(); },
+      [&](const Character& character) { out += markupFor(character.point); });
   return out;
 }
 

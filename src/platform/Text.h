@@ -79,9 +79,13 @@ std::string plainText(std::string_view text, std::string_view lineFeed);
 // of the middle of a longer text. REQUIRES: maximum >= 16.
 std::string shortPlainText(std::string_view text, size_t maximum);
 
-// For markup: the content of an element or of a quoted attribute. A control below U+0020 becomes
-// its visible picture (U+2400 and up). Invalid bytes, other controls and characters that reorder or
-// break a line become U+FFFD.
+// `text` with every character in sight: two texts that differ also look different, unless their
+// letters look alike. A control below U+0020 becomes its picture (U+2400 and up). Any other
+// character that shows nothing of its own, or that reorders its neighbours, becomes its number,
+// such as [U+200B]. Invalid bytes become U+FFFD.
+std::string visibleText(std::string_view text);
+
+// For markup: visibleText() as the content of an element or of a quoted attribute.
 std::string htmlText(std::string_view text);
 
 // `text` without the blanks at its ends.

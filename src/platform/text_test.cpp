@@ -78,7 +78,8 @@ TEST(TextTest, NothingBecomesMarkup) {
   EXPECT_EQ(htmlText("<a href='x' title=\"y\">&amp;"),
             "&lt;a href=&#39;x&#39; title=&quot;y&quot;&gt;&amp;amp;");
   // NOLINTNEXTLINE(misc-misleading-bidirectional)
-  EXPECT_EQ(htmlText("\x1b\xff\u202e\u0085"), "&#9243;\ufffd\ufffd\ufffd");
+  EXPECT_EQ(htmlText("\x1b\xff\u202e\u0085 a\u200bb\u00a0c\ufe0f\U000e0041\u00e9\U0001f600"),
+            "\u241b\ufffd[U+202E][U+0085] a[U+200B]b[U+00A0]c[U+FE0F][U+E0041]\u00e9\U0001f600");
 }
 
 TEST(TextTest, NumbersAreGrouped) {
