@@ -1,6 +1,5 @@
 #!/usr/bin/env python3
 """What `tesselctl explain` says, compared with a run's own counts and with the rules in model.py."""
-import html.parser
 import json
 import os
 import subprocess
@@ -254,93 +253,6 @@ class Follow(ExplainTest):
                          [("com.vantor.Calendar", "string_whitelist", "weekly")], result.stderr)
 
 
-class PageReader(html.parser.HTMLParser):
-    """Collects the tags, the texts and the tables of a page."""
-
-    def __init__(self, page):
-        super().__init__(convert_charrefs=True)
-        self.tags, self.attributes, self.tables, self.text = set(), [], {}, []
-        self.table, self.row = None, None
-        self.feed(page)
-
-    def handle_starttag(self, tag, attrs):
-        attributes = dict(attrs)
-        self.tags.add(tag)
-        self.attributes += list(attributes)
-        if tag == "table":
-            self.table = self.tables.setdefault(attributes["id"], [])
-        elif tag == "tr" and self.table is not None:
-            self.row = []
-            self.table.append(self.row)
-        elif tag in ("td", "th") and self.row is not None:
-            self.row.append("")
-        elif tag == "data" and self.row:
-            self.row[-1] = int(attributes["value"])
-
-    def handle_data(self, data):
-        self.text.append(data)
-        if self.row and isinstance(self.row[-1], str):
-            self.row[-1] += data
-
-
-class Report(ExplainTest):
-    MARKUP = ["<script>alert(1)</script>", "\"><img src=x onerror=alert(1)>", "</style><b>", "&lt;b&gt;", "'--><svg/onload=x>"]
-
-    def page(self, *arguments):
-        path = os.path.join(self.machine.root, "page.html")
-        self.assert_clean(self.machine.ctl("report", "--html", path, *arguments))
-        with open(path, encoding="utf-8", newline="") as file:
-            return file.read()
-
-    def test_its_figures_are_those_of_explain(self):
-        entries, _ = mixed_day(self.machine)
-        self.machine.write_export(entries)
-        self.assert_clean(self.machine.run())
-        summary = self.summary()
-        for arguments in ((), ("--last-run",)):
-            page = PageReader(self.page(*arguments))
-            verdicts = {row[0]: row[1] for row in page.tables["verdicts"][1:]}
-            self.assertEqual([verdicts[title] for title in (
-                "Reported", "Not marked for telemetry", "A text value is not a known one", "Negative duration",
-                "Held back by downsampling", "Kind cannot be reported")],
-                [summary["verdicts"][name] for name in ("reported", "telemetry_disabled", "string_whitelist", "duration",
-                                                        "downsampled", "class_not_supported")])
-            self.assertEqual({row[0]: row[1:3] for row in page.tables["pairs"][1:]},
-                             {f"{pair['subsystem']} / {pair['category']}":
-                              [sum(pair[name] for name, _ in VERDICT.values()), pair["reported"]]
-                              for pair in summary["pairs"][:40]})
-            self.assertEqual(sum(sum(row[1:]) for row in page.tables["slices"][1:]), summary["trace_objects"])
-            self.assertEqual(sum(row[0] for row in page.tables["misses"][1:]), summary["verdicts"]["string_whitelist"])
-            self.assertEqual({row[0]: {"reported": row[1], "unreported": row[2]} for row in page.tables["kinds"][1:]},
-                             summary["kinds"])
-
-    def test_the_busiest_time_may_have_a_single_object(self):
-        self.machine.write_export([point("event", "com.vantor.Calendar", "View", "Open")])
-        page = self.page()
-        [busiest] = PageReader(page).tables["slices"][1:]
-        self.assertIn(f"most, 1, from {busiest[0]}.", page)
-
-    def test_no_recorded_string_becomes_markup(self):
-        texts = self.MARKUP + ["\x1b[31mred", "\u202eright", "line\nfeed", "\x00", "caf\udce9"]
-        self.machine.write_export([point("event", "com.vantor." + text, text, text, string1=(text, text), at=-60 - i)
-                                   for i, text in enumerate(reversed(texts))])
-        page = self.page()
-        read = PageReader(page)
-        self.assertEqual(len(read.tables["pairs"]) - 1, len(texts))
-        self.assertLessEqual(read.tags, set("""html head meta title style body header h1 p main div b data section h2 svg
-                                               rect g path table tr th td span ul li details summary code footer""".split()))
-        self.assertFalse([name for name in read.attributes if name.startswith("on") or name in ("src", "href")])
-        for text in self.MARKUP:
-            self.assertIn(text, "".join(read.text))
-        for forbidden in ("\x1b", "\u202e", "\x00", "<script", "<img", "<b>alert", "http://", "https://"):
-            self.assertNotIn(forbidden, page)
-
-    def test_an_empty_period_is_a_page_too(self):
-        self.machine.write_export([log_event("nothing else")])
-        page = PageReader(self.page())
-        self.assertEqual(page.tables["verdicts"][1][1], 0)
-
-
 class Reading(ExplainTest):
     def test_entries_without_object_are_counted_by_reason(self):
         self.machine.write_export([
@@ -365,20 +277,6 @@ class Reading(ExplainTest):
         text = self.machine.ctl("explain", "--summary").out
         for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed or lost", "(vantor.service)", "process gone before _EXE was read"):
             self.assertIn(words, text)
-
-    def test_the_page_shows_what_was_lost(self):
-        self.machine.write_export([log_event("early", at=-90000), point("event", "a", "b"), point("evnt", "a", "b")])
-        self.assert_clean(self.machine.run())
-        with open(os.path.join(self.machine.store, "<b>.export"), "wb") as file:
-            file.write(b"no equals sign\n\n")
-        path = os.path.join(self.machine.root, "page.html")
-        self.assert_clean(self.machine.ctl("report", "--html", path, "--last-run"))
-        with open(path, encoding="utf-8") as file:
-            tables = PageReader(file.read()).tables
-        malformed = [1, "malformed unknown TESSEL_KIND"]
-        self.assertEqual([row[:2] for row in tables["run_losses"][1:]], [malformed])
-        self.assertEqual([row[:2] for row in tables["losses"][1:]], [[1, "file_damaged line that is no field"], malformed])
-        self.assertEqual(tables["losses"][1][2].strip(), os.path.join(self.machine.store, "<b>.export, byte 0"))
 
     def test_a_damaged_file_is_named_and_the_rest_is_read(self):
         self.machine.write_export([point("event", "com.vantor.A", "B", "C")])

@@ -9,6 +9,7 @@
 
 #include "linux/RunRecordFile.h"
 #include "tesselctl/commands/Command.h"
+#include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/showing/HtmlReport.h"
 #include "tesselctl/showing/OutputFile.h"
 
@@ -20,6 +21,7 @@ struct ReportOptions {
   ReadingOptions reading;
   std::string html;
   bool lastRun = false;
+  bool withoutValues = false;
 };
 
 // POSIX does not say that a name which is cut off ends with a NUL. The array starts with zeros and
@@ -63,7 +65,13 @@ int runReport(const ReportOptions& options, const Surroundings& surroundings) {
                     std::string(nameForPlatform(reading->machine.platform)),
                     reading->machine.internal,
                     surroundings.now,
-                    {}};
+                    {},
+                    {},
+                    options.withoutValues};
+  // A store that the command line names may be a copy from elsewhere. The state of this machine
+  // then says nothing about it.
+  if (!options.reading.store)
+    facts.findings = gatherStatus(surroundings.launch, surroundings.now).findings;
   if (options.lastRun) {
     if (options.reading.period.given()) return fail(kUsage, "--last-run has a period of its own");
     const std::string& directory = surroundings.launch.stateDirectory;
@@ -76,13 +84,12 @@ int runReport(const ReportOptions& options, const Surroundings& surroundings) {
   return makeReport(options, *reading, facts);
 }
 
-const CommandText kReport{
-    "report", "Make a page about what was recorded, reported and held back",
-    "One self-contained page without scripts. Its figures are those of 'tesselctl explain "
-    "--summary\n"
-    "--json' for the same period.\n\n"
-    "Example:\n"
-    "  tesselctl report --last 7d --html week.html"};
+const CommandText kReport{"report", "Make a page about what was recorded, reported and held back",
+                          "One self-contained page. Its figures are those of 'tesselctl explain "
+                          "--summary\n"
+                          "--json' for the same period.\n\n"
+                          "Example:\n"
+                          "  tesselctl report --last 7d --html week.html"};
 
 }  // namespace
 
@@ -93,6 +100,8 @@ void addReportCommand(CLI::App& app, Invocation& invocation) {
       ->type_name("FILE");
   command.add_flag("--last-run", options.lastRun,
                    "The 24 hours that the last run looked back on, with its own books");
+  command.add_flag("--without-values", options.withoutValues,
+                   "Leave out recorded values, users, executables, paths and the machine's name");
   addPeriodOptions(command, options.reading);
   addJudgeOptions(command, options.reading);
 }

@@ -1,13 +1,15 @@
 // The report page: the figures of a dry run for people, in one self-contained HTML file.
 //
-// The page has no script and loads nothing from elsewhere. A policy in the page forbids both.
-// Stateless.
+// The page loads nothing from elsewhere and runs no script but its own, which only adds a filter
+// and sorting to long lists. A policy in the page forbids everything else. Stateless.
 
 #pragma once
 
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "linux/Findings.h"
 #include "objects/RunRecord.h"
 #include "tesselctl/judging/Tally.h"
 #include "trace/JournalExtractor.h"
@@ -21,6 +23,11 @@ struct ReportFacts {
   bool internal = false;
   Date made{};
   std::optional<RunRecord> run;  // absent unless the page shows the period of a run
+  // What is wrong with this machine. Absent if the store may be that of another machine.
+  std::optional<std::vector<Finding>> findings;
+  // The page is to be passed on to people outside: it names neither the machine nor its users,
+  // programs and files, and shows no recorded value.
+  bool withoutValues = false;
 };
 
 std::string htmlReport(const Tally& tally, const ExtractionReport& report,
