@@ -49,7 +49,10 @@ def field(name: str, value: bytes) -> bytes:
 
 def _wait_from_environment() -> int:
     text = os.environ.get("TESSEL_TRACE_WAIT", "")
-    return min(int(text), WAIT_MS_MAX) if text.isascii() and text.isdigit() else WAIT_MS
+    if not text.isascii() or not text.isdigit():
+        return WAIT_MS
+    digits = text.lstrip("0")[:5]  # int() refuses thousands of them
+    return min(int(digits or "0"), WAIT_MS_MAX)
 
 
 def _has_more_rights() -> bool:
