@@ -20,11 +20,14 @@ using namespace tessel;
 class KeepingSink final : public TraceObjectSink {
  public:
   explicit KeepingSink(Writers& writers)
-      : shares_(writers, {.pairs = 16, .pairBytes = 256, .images = 16, .imageBytes = 256}) {}
+      : shares_(writers,
+                {.pairs = 16, .pairBytes = 256, .images = 16, .imageBytes = 256, .counters = 16}),
+        losses_(writers, [this](const Origin& one) { return shares_.admitsCounter(one); }) {}
   bool admits(const ObjectOffer& offer) override {
     if (!offer.subsystem() || !offer.category()) std::abort();
     return shares_.admits(offer);
   }
+  void addTold(const ToldLosses& told) override { losses_.add(told); }
   void deliverEvent(std::shared_ptr<const TesselEvent> event) override { keep(std::move(event)); }
   void deliverInterval(std::shared_ptr<const TesselInterval> interval) override {
     interval->attribute("BundleIdOverride");
@@ -41,6 +44,7 @@ class KeepingSink final : public TraceObjectSink {
     old = std::move(object);
   }
   Shares shares_;
+  SourceLosses losses_;
   std::shared_ptr<const TesselObject> kept_[16];
   size_t next_ = 0;
 };

@@ -170,6 +170,28 @@ class InsideDaemon(MachineTest):
         self.assertEqual(sent(self.machine), expected + [("Event", "Logged")])
         self.log_to_the_journal(len(expected) + 1)
 
+    def test_the_books_of_a_burst_that_lost_points_balance(self):
+        """The program records two more points while it ends; a run and a look read the same journal."""
+        burst = os.path.join(BIN, "trace_burst")
+        subprocess.run([burst, "10000"], check=True, env=self.machine.environment(TESSEL_TRACE_WAIT="0"))
+        subprocess.run(["journalctl", "--sync"], check=True)
+        machine = {"TESSEL_TRACE_STORE": None}
+        explain = ("explain", "--last", "1h", "--subsystem", "com.vantor.Calendar", "--summary")
+        summary = json.loads(self.machine.ctl(*explain, "--json", **machine).out)
+        points = next(pair for pair in summary["pairs"] if pair["category"] == "Burst")
+        lost = summary["lost_at_source"]
+        self.assertGreater(lost, 0, "nothing was lost: this proves nothing")
+        self.assertEqual(points["telemetry_disabled"] + lost, 10_002)
+        self.assertEqual(summary["lost_earlier"], 0)
+        told = [loss for loss in summary["losses"] if loss["code"] == "lost_at_source"]
+        self.assertEqual([(loss["count"], loss.get("uid"), loss["place"]) for loss in told], [(lost, 0, burst)])
+        self.assertIn(f"{lost:,} lost_at_source: ", self.machine.ctl(*explain, **machine).out)
+        self.run_clean(**machine)
+        status = json.loads(self.machine.ctl("status", "--json", **machine).out)
+        self.assertEqual(status["last_run"]["reading"]["lost_at_source"], lost)
+        self.assertIn("lost_at_source", [note["code"] for note in status["notes"]])
+        self.assertNotIn("lost_at_source", [problem["code"] for problem in status["problems"]])
+
     def log_to_the_journal(self, delivered):
         """A service that logs to the journal that it reads meets its own lines there: none is a trace point."""
         for run in (1, 2):

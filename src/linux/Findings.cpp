@@ -78,8 +78,8 @@ constexpr struct {
      "The rest of the day is read only if the next run begins less than a day after this one.",
      "journalctl -u tessel-reporter -g 'stopped early' --since=-2d"},
     {FindingCode::lostAtSource, "lost_at_source",
-     "The journal had no room when the programs recorded. Let them record less, or raise the rate "
-     "limit of their units.",
+     "The journal had no room when the programs recorded. Let them record less at a time, or wait "
+     "longer for room (TESSEL_TRACE_WAIT).",
      "tesselctl explain --last 24h --summary"},
     {FindingCode::droppedByDaemon, "dropped_by_daemon",
      "Raise LogRateLimitBurst= of the unit that is named, or let it log less.",
@@ -120,7 +120,8 @@ constexpr size_t kMaxOfAKind = 16;
 constexpr std::string_view kObjectsLost = "Writers had more than their share, objects lost: ";
 
 // Codes that stand side by side and have one reason share a line. Losses whose code is not here
-// cost nobody a trace point: a point whose executable is unknown is reported under another name.
+// cost the day no trace point: a point whose executable is unknown is reported under another name,
+// and what was lost earlier was lost before the day, as far as anybody knows.
 struct LossFinding {
   LossCode first, last;
   FindingCode finding;
@@ -137,6 +138,8 @@ constexpr LossFinding kLossFindings[] = {
      "Entries are in no file of the trace store: "},
     {LossCode::malformed, LossCode::malformed, FindingCode::malformed,
      "Trace points were malformed: "},
+    {LossCode::lostAtSource, LossCode::lostAtSource, FindingCode::lostAtSource,
+     "Programs lost trace points before the journal: "},
     // Begins and objects are different things, so a sum of both would mean nothing. Five lines at
     // most, however many writers there are.
     {LossCode::openIntervalDropped, LossCode::openIntervalDropped, FindingCode::overShare,

@@ -46,6 +46,7 @@ constexpr struct {
     {"Files of the trace store were not read: ", "e51135e212e748588088feaa13b643c7"},
     {"The trace store is damaged: ", "06d3ff7cb7194f92b1f79ebf73be148c"},
     {"The journal daemon dropped entries: ", "4bd946453b0c49acbcadbee2afe8b087"},
+    {"Programs lost trace points before the journal: ", "7861efa4964e40e2b3254afdc679c75d"},
     {"Entries are in no file of the trace store: ", "b1c6565b3ac74fb59a9d2fd41894851c"},
     {"Trace points were malformed: ", "aa58f7272a6b43bd9e8469473d0cd602"},
     {"Writers had more than their share, ", "c406cfaadd0b41668e8fdd01c190de7c"},

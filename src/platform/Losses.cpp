@@ -1,7 +1,7 @@
 // The names of losses, and the list of them.
 //
 // The list is short, so it is searched from one end to the other. A usual day has fewer than ten
-// losses. The most are twelve codes with 17 losses each: 16 and the "other" one.
+// losses. The most are fourteen codes with 17 losses each: 16 and the "other" one.
 
 #include "platform/Losses.h"
 
@@ -18,9 +18,10 @@ constexpr std::string_view kOther = "other";
 
 // These names stand in the records of runs and in what programs read, so none is ever changed.
 constexpr std::array<std::string_view, kLossCodes> kNames = {
-    "file_skipped",      "files_not_looked_at", "file_damaged",      "entries_missing",
-    "dropped_by_daemon", "no_image_path",       "malformed",         "open_interval_dropped",
-    "beyond_pair_limit", "beyond_image_limit",  "beyond_text_limit", "beyond_time_limit"};
+    "file_skipped",      "files_not_looked_at",   "file_damaged",      "entries_missing",
+    "dropped_by_daemon", "no_image_path",         "malformed",         "lost_at_source",
+    "lost_earlier",      "open_interval_dropped", "beyond_pair_limit", "beyond_image_limit",
+    "beyond_text_limit", "beyond_time_limit"};
 
 // A failing disk damages many files in the same way. The kind of damage then says more than the
 // list of files, so damage is summed over all files. Losses of the other codes stay apart by place.
@@ -44,7 +45,7 @@ std::optional<LossCode> lossNamed(std::string_view name) {
 // The offset is that of the first place: whoever looks into a damaged file begins there.
 std::string Loss::where() const {
   std::string where = place.name;
-  if (isOverShare(code) && !where.empty()) {
+  if (isOfWriter(code) && !where.empty()) {
     // A writer is a user first: anyone can give a program any path.
     where = (place.user ? "user " + std::to_string(*place.user) : "unknown user") + ", " + where;
   }

@@ -30,17 +30,24 @@ enum class LossCode : uint8_t {
   droppedByDaemon,   // entries that the journal daemon dropped; the place is the unit
   noImagePath,       // trace points whose executable is not known
   malformed,         // entries with the mark of a trace point but bad fields
-  // From here on each loss belongs to the writer who had more than his share. Its place is his
-  // executable, and his user.
+  // From here on each loss belongs to a writer. Its place is his executable, and his user.
+  lostAtSource,  // trace points of the period that the program could not hand to the journal
+  lostEarlier,   // such points of a program that began to lose before the period, up to its first
+                 // entry in it
+  // From here on the writer had more than his share.
   openIntervalDropped,  // begins that were dropped to make room for younger ones
   beyondPairLimit,      // objects whose pair of subsystem and category was not kept
   beyondImageLimit,     // objects of an executable that was not kept
   beyondTextLimit,      // objects for whose rows the spool had no room left
   beyondTimeLimit,      // objects for which the run had no time left
 };
-inline constexpr size_t kLossCodes = 12;
+inline constexpr size_t kLossCodes = 14;
 
-// Whether losses of the code belong to a writer who had more than his share.
+// Whether losses of the code belong to a writer.
+constexpr bool isOfWriter(LossCode code) {
+  return code >= LossCode::lostAtSource && code <= LossCode::beyondTimeLimit;
+}
+// Whether that writer had more than his share.
 constexpr bool isOverShare(LossCode code) {
   return code >= LossCode::openIntervalDropped && code <= LossCode::beyondTimeLimit;
 }
@@ -53,7 +60,7 @@ std::optional<LossCode> lossNamed(std::string_view name);
 struct LossPlace {
   std::string name;                   // of a file, a unit or an executable; empty if there is none
   std::optional<uint64_t> offset;     // bytes from the start of that file
-  std::optional<uint32_t> user = {};  // of a writer over his share; absent if nobody knows it
+  std::optional<uint32_t> user = {};  // of a writer; absent if nobody knows it
 
   bool operator==(const LossPlace&) const = default;
 };

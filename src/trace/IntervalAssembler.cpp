@@ -46,8 +46,14 @@ void IntervalAssembler::consume(const Entry& entry) {
 }
 
 void IntervalAssembler::take(const Entry& entry) {
-  if (!meansToBeATracePoint(entry.tokens)) return;
+  const bool isPoint = meansToBeATracePoint(entry.tokens);
+  if (!isPoint && std::ranges::find(entry.tokens, FieldKind::lost, &TracePointTable::kind) ==
+                      entry.tokens.end())
+    return;
   read(entry.tokens);
+  if (point_.lost != 0) [[unlikely]]
+    tellLosses(entry.header);
+  if (!isPoint) return;
   if (const auto reason = fault()) {
     ++counts_.malformed[static_cast<size_t>(*reason)];
     return;
@@ -80,6 +86,8 @@ void IntervalAssembler::read(std::span<const FieldToken> tokens) {
   point_.tokens.fill(kNoToken);
   point_.attributes.clear();
   point_.malformed = kNoToken;
+  point_.lost = 0;
+  point_.lostSince = 0;
   FieldToken repeated = kNoToken;
   for (const FieldToken token : tokens) {
     const FieldKind kind = TracePointTable::kind(token);
@@ -91,10 +99,19 @@ void IntervalAssembler::read(std::span<const FieldToken> tokens) {
       point_.attributes.push_back(token);
     } else if (kind == FieldKind::malformed) {
       point_.malformed = lesserFault(point_.malformed, token);
+    } else if (kind == FieldKind::lost) {
+      point_.lost = std::max(point_.lost, table_.count(token));
+    } else if (kind == FieldKind::lostSince) {
+      point_.lostSince = std::max(point_.lostSince, table_.count(token));
     }
   }
   if (repeated != kNoToken) [[unlikely]]
     readRepeated(tokens);
+}
+
+void IntervalAssembler::tellLosses(const EntryHeader& header) {
+  sink_.addTold({writer(), header.bootId, table_.user(point_[FieldKind::process]).value_or(0),
+                 point_.lostSince, point_.lost});
 }
 
 // A journal sorts the fields of an entry, so which of several values came first cannot be known.

@@ -22,6 +22,7 @@
 #include "platform/Losses.h"
 #include "trace/OpenIntervals.h"
 #include "trace/Shares.h"
+#include "trace/SourceLosses.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel {
@@ -32,6 +33,8 @@ class TraceObjectSink {
   virtual ~TraceObjectSink() = default;
   // Whether the assembler shall make the object. If so, it delivers it next.
   virtual bool admits(const ObjectOffer& offer) = 0;
+  // An entry tells what its program lost so far.
+  virtual void addTold(const ToldLosses& told) = 0;
   virtual void deliverEvent(std::shared_ptr<const TesselEvent> event) = 0;
   virtual void deliverInterval(std::shared_ptr<const TesselInterval> interval) = 0;
   virtual void deliverAnimationInterval(
@@ -75,6 +78,8 @@ class IntervalAssembler {
     PointTokens tokens;
     std::vector<FieldToken> attributes;
     FieldToken malformed;
+    uint64_t lost;  // the greatest total that the entry tells; 0: none
+    uint64_t lostSince;
 
     FieldToken operator[](FieldKind kind) const { return tokens[static_cast<size_t>(kind)]; }
   };
@@ -91,6 +96,7 @@ class IntervalAssembler {
   void take(const Entry& entry);
   void startGeneration();
   bool meansToBeATracePoint(std::span<const FieldToken> tokens) const;
+  void tellLosses(const EntryHeader& header);
   void read(std::span<const FieldToken> tokens);
   void readRepeated(std::span<const FieldToken> tokens);
   FieldToken lesserFault(FieldToken a, FieldToken b) const;

@@ -50,6 +50,7 @@ JournalExtractor::JournalExtractor(std::optional<std::string> systemStore,
     : systemStore_(std::move(systemStore)),
       table_(limits.table),
       shares_(writers_, limits.shares),
+      sourceLosses_(writers_, [this](const Origin& one) { return shares_.admitsCounter(one); }),
       assembler_(table_, writers_, *this, limits.openIntervals) {}
 
 void JournalExtractor::chargeBy(Clock& clock, std::function<Spending()> spending) {
@@ -83,6 +84,7 @@ bool JournalExtractor::processLogArchiveWithPath(const std::optional<std::string
   const TimeRange range{microsecondsSince1970(startDate), microsecondsSince1970(endDate)};
   report_.store.reading.rangeStart = range.start;
   report_.store.reading.rangeEnd = range.end;
+  startLossesAt(range.start);
   if (stop_.load(std::memory_order_relaxed)) {
     report_.stopped = true;
     return true;
@@ -144,6 +146,8 @@ std::optional<StoreReading> JournalExtractor::reading() const {
 }
 
 bool JournalExtractor::admits(const ObjectOffer& offer) { return shares_.admits(offer); }
+
+void JournalExtractor::addTold(const ToldLosses& told) { sourceLosses_.add(told); }
 
 // We count before the call, because a callback that answers false did receive its object. Only what
 // is marked for telemetry can be sent. Anything else costs a callback less than two looks at the

@@ -83,6 +83,9 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   // REQUIRES: the stream was made with tokenizer() and stopFlag().
   void processEntries(EntryStream& entries);
   FieldTokenizer& tokenizer() { return table_; }
+  // The start of the period that such a caller reads, in microseconds since 1970: what programs
+  // lost before it is told apart.
+  void startLossesAt(uint64_t rangeStart) { sourceLosses_.startAt(rangeStart); }
   const StopFlag& stopFlag() const { return stop_; }
 
   // The header of the entry that completed the object of the running callback. For an interval that
@@ -95,6 +98,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
 
  private:
   bool admits(const ObjectOffer& offer) override;
+  void addTold(const ToldLosses& told) override;
   void deliverEvent(std::shared_ptr<const TesselEvent> event) override;
   void deliverInterval(std::shared_ptr<const TesselInterval> interval) override;
   void deliverAnimationInterval(std::shared_ptr<const TesselAnimationInterval> interval) override;
@@ -108,6 +112,7 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   TracePointTable table_;
   Writers writers_;
   Shares shares_;
+  SourceLosses sourceLosses_;
   IntervalAssembler assembler_;
   StopFlag stop_ = false;
   bool refused_ = false;  // a callback answered false

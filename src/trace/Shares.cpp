@@ -38,8 +38,8 @@ size_t jsonSize(const ObjectOffer& offer, FieldToken token) {
 
 Shares::Shares(Writers& writers, const ShareLimits& limits)
     : writers_(writers),
-      limits_{limits.pairs,      limits.pairBytes, limits.images,
-              limits.imageBytes, limits.rowBytes,  limits.nanoseconds},
+      limits_{limits.pairs,    limits.pairBytes,   limits.images,  limits.imageBytes,
+              limits.rowBytes, limits.nanoseconds, limits.counters},
       spaceOfRow_(limits.spaceOfRow) {
   for (size_t kind = 0; kind < kKinds; ++kind)
     openToAll_[kind] = threeQuarters(threeQuarters(limits_[kind]));
@@ -131,6 +131,12 @@ bool Shares::hasOrTakes(Admitted& admitted, Key key, uint64_t bytes, Kind count,
   take(text, bytes, writer);
   admitted.index.add(hash, static_cast<uint32_t>(admitted.keys.size()));
   admitted.keys.push_back(key);
+  return true;
+}
+
+bool Shares::admitsCounter(const Origin& origin) {
+  if (!mayTake(kCounters, 1, origin)) return false;
+  take(kCounters, 1, writers_.numberOf(origin));
   return true;
 }
 

@@ -1,5 +1,5 @@
 // Shares: divides among the writers what a run has only once: pairs, executables, the text that
-// goes to the spool, and time.
+// goes to the spool, time, and counters of losses at the source.
 //
 // What is given away cannot be taken back, so the last quarter of each total is kept for those who
 // come late: it goes only to users who hold less than a sixteenth of the total. Among the
@@ -27,6 +27,7 @@
 
 #include "platform/FlatIndex.h"
 #include "platform/Losses.h"
+#include "trace/SourceLosses.h"
 #include "trace/TracePointTable.h"
 #include "trace/Writers.h"
 
@@ -47,6 +48,7 @@ struct ShareLimits {
   // What a row with so many bytes of text takes of rowBytes.
   uint64_t (*spaceOfRow)(size_t textBytes) = [](size_t textBytes) -> uint64_t { return textBytes; };
   uint64_t nanoseconds = kNoLimit;  // that a run may take
+  uint64_t counters = SourceLosses::kMaxCounters;
 };
 
 // An object before it is made: the tokens that it will be made of. For an event both are the same.
@@ -88,6 +90,8 @@ class Shares {
       return true;
     return weighs(offer);
   }
+  // Whether the writer may have one more counter of losses. Takes it.
+  bool admitsCounter(const Origin& writer);
   // Adds what the delivery of an admitted object has cost.
   void charge(const Origin& writer, uint64_t rowBytes, uint64_t nanoseconds);
 
@@ -96,7 +100,16 @@ class Shares {
   uint64_t pairs() const { return pairs_.keys.size(); }
 
  private:
-  enum Kind : size_t { kPairs, kPairBytes, kImages, kImageBytes, kRowBytes, kTime, kKinds };
+  enum Kind : size_t {
+    kPairs,
+    kPairBytes,
+    kImages,
+    kImageBytes,
+    kRowBytes,
+    kTime,
+    kCounters,
+    kKinds
+  };
   using Amounts = std::array<uint64_t, kKinds>;
   // What was admitted, by two hashes. The hashes are seeded, so a writer cannot make up two texts
   // that share one, and no text has to be kept.

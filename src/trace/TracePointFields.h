@@ -49,6 +49,10 @@ enum class FieldKind : uint8_t {
   user,
   sessionOwner,
   attribute,
+  // What a program lost so far, and since when. They have no slot, because few entries have them
+  // and no object has.
+  lost,
+  lostSince,
   // These two are no journal fields. `malformed` stands for a bad value of any field, `boot` for
   // the boot that the header of an entry names.
   malformed,
@@ -164,8 +168,10 @@ inline constexpr JournalField kJournalFields[] = {
     {FieldKind::sessionOwner, "_SYSTEMD_OWNER_UID", ValueForm::recurring},
     {FieldKind::attribute, "TESSEL_ATTRIBUTE", ValueForm::attribute,
      MalformedReason::invalidAttribute},
+    {FieldKind::lost, "TESSEL_LOST", ValueForm::recurring},
+    {FieldKind::lostSince, "TESSEL_LOST_SINCE", ValueForm::recurring},
 };
-static_assert(std::size(kJournalFields) == kPointSlots + 1);
+static_assert(std::size(kJournalFields) == static_cast<size_t>(FieldKind::malformed));
 static_assert(std::ranges::all_of(kJournalFields, [](const JournalField& field) {
   return &field == &kJournalFields[static_cast<size_t>(field.kind)];
 }));

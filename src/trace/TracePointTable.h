@@ -61,11 +61,18 @@ class TracePointTable final : public FieldTokenizer {
   uint64_t identity(FieldToken token) const { return at(token).identity(); }
   StringRef text(FieldToken token) const { return StringRef(at(token).record); }
   std::optional<Number> number(FieldToken token) const;
-  // The number if it can be that of a user.
+  // The number if it can be that of a user or process.
   std::optional<uint32_t> user(FieldToken token) const {
     const Field& field = at(token);
     if (field.form != Form::whole || field.whole > UINT32_MAX) return std::nullopt;
     return static_cast<uint32_t>(field.whole);
+  }
+  // The number if it is one that counts something; else 0.
+  uint64_t count(FieldToken token) const {
+    const Field& field = at(token);
+    const bool counts = field.form == Form::unsignedWhole ||
+                        (field.form == Form::whole && field.whole <= uint64_t{INT64_MAX});
+    return counts ? field.whole : 0;
   }
   float real(FieldToken token) const { return at(token).real; }
   PointKind pointKind(FieldToken token) const;

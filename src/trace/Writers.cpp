@@ -15,10 +15,14 @@ namespace {
 // The record of a run shortens a place to this length.
 constexpr size_t kMaxNameBytes = 256;
 
-// In the order of the codes, from openIntervalDropped on.
-constexpr std::string_view kWords[] = {
-    "begins that were too many to wait", "too many pairs of subsystem and category",
-    "too many executables", "too much text for one run", "too much of the time of a run"};
+// In the order of the codes, from lostAtSource on.
+constexpr std::string_view kWords[] = {"the journal had no room for them",
+                                       "told by programs that began to lose before the period",
+                                       "begins that were too many to wait",
+                                       "too many pairs of subsystem and category",
+                                       "too many executables",
+                                       "too much text for one run",
+                                       "too much of the time of a run"};
 
 }  // namespace
 
@@ -64,15 +68,14 @@ uint32_t Writers::add(uint32_t user, uint64_t image, std::string name) {
 }
 
 void Writers::lost(uint32_t writer, LossCode code, uint64_t count) {
-  TESSEL_INVARIANT(isOverShare(code));
+  TESSEL_INVARIANT(isOfWriter(code));
   writers_[writer].lost[indexOf(code)] += count;
   sums_[indexOf(code)] += count;
 }
 
 void Writers::addLosses(Losses& losses) const {
-  for (size_t code = 0; code < kShareCodes; ++code)
-    addLosses(static_cast<LossCode>(code + static_cast<size_t>(LossCode::openIntervalDropped)),
-              losses);
+  for (size_t code = 0; code < kCodes; ++code)
+    addLosses(static_cast<LossCode>(code + kFirstCode), losses);
 }
 
 LossPlace Writers::placeFor(const Writer& writer) const {

@@ -67,18 +67,17 @@ class Writers {
   size_t size() const { return writers_.size(); }
   size_t users() const { return users_.size(); }
 
-  // Notes that the writer lost something because he had more than his share. REQUIRES:
-  // isOverShare(code).
+  // Notes that the writer lost something. REQUIRES: isOfWriter(code).
   void lost(uint32_t writer, LossCode code, uint64_t count = 1);
   uint64_t lostOf(LossCode code) const { return sums_[indexOf(code)]; }
   // Adds a loss for each writer who lost something, most first.
   void addLosses(Losses& losses) const;
 
  private:
-  static constexpr size_t kShareCodes = static_cast<size_t>(LossCode::beyondTimeLimit) -
-                                        static_cast<size_t>(LossCode::openIntervalDropped) + 1;
+  static constexpr size_t kFirstCode = static_cast<size_t>(LossCode::lostAtSource);
+  static constexpr size_t kCodes = static_cast<size_t>(LossCode::beyondTimeLimit) - kFirstCode + 1;
   static constexpr uint32_t kNone = FlatIndex::kNone;
-  using Counts = std::array<uint64_t, kShareCodes>;  // by indexOf()
+  using Counts = std::array<uint64_t, kCodes>;  // by indexOf()
 
   struct User {
     uint64_t key;
@@ -100,9 +99,7 @@ class Writers {
   static uint64_t keyOf(std::optional<uint32_t> user) {
     return user ? uint64_t{*user} : kUnknownUser;
   }
-  static size_t indexOf(LossCode code) {
-    return static_cast<size_t>(code) - static_cast<size_t>(LossCode::openIntervalDropped);
-  }
+  static size_t indexOf(LossCode code) { return static_cast<size_t>(code) - kFirstCode; }
   uint32_t userNumber(uint64_t key);
   uint32_t add(uint32_t user, uint64_t image, std::string name);
   LossPlace placeFor(const Writer& writer) const;

@@ -8,11 +8,8 @@
 
 #include "tessel/trace.h"
 
-static tessel_point point = {.subsystem = "com.vantor.Calendar",
-                             .category = "View",
-                             .name = "Burst",
-                             .telemetry = true,
-                             .string1 = {"period", "week"}};
+static tessel_point point = {
+    .subsystem = "com.vantor.Calendar", .category = "Burst", .string1 = {"period", "week"}};
 
 static void record_at_exit(void) { tessel_event(&point); }
 

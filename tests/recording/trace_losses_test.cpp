@@ -9,6 +9,8 @@
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
+#include <filesystem>
+#include <iterator>
 #include <string>
 #include <thread>
 #include <vector>
@@ -156,6 +158,34 @@ TEST_F(TraceLosses, ABurstWaitsForAJournalThatTakesPoints) {
   for (int i = 0; i < 3000; ++i) failed += tessel_event(&point) != 0;
   EXPECT_EQ(failed, 0);
   EXPECT_EQ(taking.stop().size(), 3000u);
+}
+
+size_t openDescriptors() {
+  const std::filesystem::directory_iterator all("/proc/self/fd");
+  return static_cast<size_t>(std::distance(begin(all), end(all)));
+}
+
+// Each of these travels in a memory file, which must be closed whatever becomes of the point.
+TEST_F(TraceLosses, LargePointsLeaveNoDescriptor) {
+  const std::string text(4000, 'x');
+  const std::string tooLong(TESSEL_VALUE_MAX + 1, 'x');
+  std::vector<tessel_attribute> attributes(8, {"Filler", text.c_str()});
+  tessel_point point = somePoint();
+  point.attributes = attributes.data();
+  point.attribute_count = attributes.size();
+  point.no_wait = true;
+  ASSERT_EQ(tessel_event(&point), 0);
+  EXPECT_TRUE(only().wasFile);
+  const size_t before = openDescriptors();
+  for (int i = 0; i < 1000; ++i) tessel_event(&point);  // more than the socket takes
+  EXPECT_EQ(tessel_event(&point), EAGAIN);
+  attributes.back().value = tooLong.c_str();
+  EXPECT_EQ(tessel_event(&point), EMSGSIZE);
+  journal.stop();
+  attributes.back().value = text.c_str();
+  EXPECT_EQ(tessel_event(&point), ECONNREFUSED);
+  EXPECT_LE(openDescriptors(), before);
+  journal.start();
 }
 
 // The times are bounds of the rule with room for a busy machine: 20 ms once, and then a thousandth.

@@ -153,6 +153,7 @@ std::optional<PlatformError> DryRun::readOnce(TimeRange range,
 
 std::optional<PlatformError> DryRun::read(const Period& period, const Progress& progress) {
   const TimeRange range{microsecondsSince1970(period.start), microsecondsSince1970(period.end)};
+  extractor_.startLossesAt(range.start);
   return readOnce(range, [&](EntryStream& entries) {
     WatchedStream watched(entries, range, progress);
     extractor_.processEntries(watched);

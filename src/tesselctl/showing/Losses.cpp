@@ -108,6 +108,8 @@ void addReading(JsonWriter& json, const StoreReading& reading) {
               [&] { json.member("dropped", losses.sum(LossCode::openIntervalDropped)); });
   addStore(json, reading);
   addOverShare(json, losses);
+  json.member("lost_at_source", losses.sum(LossCode::lostAtSource));
+  json.member("lost_earlier", losses.sum(LossCode::lostEarlier));
   json.member("stopped", reading.stopped).member("unread_microseconds", reading.unread());
   json.member("dropped_not_listed", losses.notListed(LossCode::droppedByDaemon));
   json.member("files_read", reading.filesRead);

@@ -75,6 +75,7 @@ class AssemblerFixture : public ::testing::Test, protected TraceObjectSink {
  private:
   TraceObjectSink& sink() { return *this; }
   bool admits(const ObjectOffer&) override { return true; }
+  void addTold(const ToldLosses&) override {}
   void deliverEvent(std::shared_ptr<const TesselEvent> event) override {
     std::string line = describe(*event);
     addProcess(line, "exe", {event->processImagePath(), event->processName()});
