@@ -172,8 +172,9 @@ class InsideDaemon(MachineTest):
 
     def test_the_books_of_a_burst_that_lost_points_balance(self):
         """The program records two more points while it ends; a run and a look read the same journal."""
-        burst = os.path.join(BIN, "trace_burst")
-        subprocess.run([burst, "10000"], check=True, env=self.machine.environment(TESSEL_TRACE_WAIT="0"))
+        burst = os.path.realpath(os.path.join(BIN, "trace_burst"))
+        subprocess.run([burst, "10000"], check=True, stdout=subprocess.DEVNULL,
+                       env=self.machine.environment(TESSEL_TRACE_WAIT="0"))
         subprocess.run(["journalctl", "--sync"], check=True)
         machine = {"TESSEL_TRACE_STORE": None}
         explain = ("explain", "--last", "1h", "--subsystem", "com.vantor.Calendar", "--summary")
@@ -184,8 +185,10 @@ class InsideDaemon(MachineTest):
         self.assertEqual(points["telemetry_disabled"] + lost, 10_002)
         self.assertEqual(summary["lost_earlier"], 0)
         told = [loss for loss in summary["losses"] if loss["code"] == "lost_at_source"]
-        self.assertEqual([(loss["count"], loss.get("uid"), loss["place"]) for loss in told], [(lost, 0, burst)])
-        self.assertIn(f"{lost:,} lost_at_source: ", self.machine.ctl(*explain, **machine).out)
+        self.assertEqual(sum(loss["count"] for loss in told), lost)
+        # A daemon that lags behind reads the entries when the process has gone, and nobody knows the executable.
+        self.assertLessEqual({(loss.get("uid"), loss["place"]) for loss in told}, {(0, burst), (None, "unknown")})
+        self.assertIn(f"{told[0]['count']:,} lost_at_source: ", self.machine.ctl(*explain, **machine).out)
         self.run_clean(**machine)
         status = json.loads(self.machine.ctl("status", "--json", **machine).out)
         self.assertEqual(status["last_run"]["reading"]["lost_at_source"], lost)

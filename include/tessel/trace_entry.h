@@ -7,6 +7,8 @@
 
 #include "trace_check.h"
 
+/* NOLINTBEGIN(modernize-use-nullptr): this is C as well */
+
 /* Text that reads back as the same double, never as an integer, in any locale. */
 TESSEL_SLOW_ void tessel_put_double_(tessel_message_* message, const char* name, double value) {
   char text[40];
@@ -213,5 +215,7 @@ TESSEL_SLOW_ int tessel_end_(tessel_interval* token, const tessel_point* point,
   if (token) token->open = false;
   return tessel_record_(TESSEL_END_, point, token, frame_rate, place, &lost);
 }
+
+/* NOLINTEND(modernize-use-nullptr) */
 
 #endif

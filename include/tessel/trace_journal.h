@@ -39,6 +39,8 @@ extern "C" {
 extern long syscall(long number, ...); /* strict C11 hides it */
 #endif
 
+/* NOLINTBEGIN(modernize-use-nullptr): this is C as well */
+
 enum {
   /* what strict C11 hides */
   TESSEL_S_IFMT_ = 0170000,
@@ -309,6 +311,7 @@ TESSEL_SLOW_ int tessel_offer_within_(tessel_message_* message, int error, uint6
  * takes this time sets the beginning anew, so it is taken once however many threads record. */
 TESSEL_SLOW_ int tessel_wait_(tessel_message_* message, int error) {
   uint64_t limit = (uint64_t)tessel_wait_limit_() * 1000000u;
+  const uint64_t taken = __atomic_load_n(&tessel_state_v2_.taken, __ATOMIC_RELAXED);
   uint64_t stuck = __atomic_load_n(&tessel_state_v2_.stuck, __ATOMIC_RELAXED);
   const uint64_t now = tessel_now_ns_();
   if (limit == 0) return error;
@@ -322,7 +325,11 @@ TESSEL_SLOW_ int tessel_wait_(tessel_message_* message, int error) {
     }
   }
   error = tessel_offer_within_(message, error, limit);
-  if (tessel_is_full_(error)) __atomic_store_n(&tessel_state_v2_.stuck, now, __ATOMIC_RELAXED);
+  /* Another thread may have been quicker each time. Then the daemon does take points. */
+  const bool idle = taken == __atomic_load_n(&tessel_state_v2_.taken, __ATOMIC_RELAXED);
+  if (tessel_is_full_(error) && idle) {
+    __atomic_store_n(&tessel_state_v2_.stuck, now, __ATOMIC_RELAXED);
+  }
   return error;
 }
 
@@ -332,8 +339,11 @@ TESSEL_INNER_ int tessel_deliver_(tessel_message_* message, bool may_wait) {
   if (message->error) return message->error;
   int error = tessel_offer_(message);
   if (__builtin_expect(tessel_is_full_(error), 0) && may_wait) error = tessel_wait_(message, error);
-  if (!error && __atomic_load_n(&tessel_state_v2_.stuck, __ATOMIC_RELAXED)) {
-    __atomic_store_n(&tessel_state_v2_.stuck, 0, __ATOMIC_RELAXED);
+  if (!error) {
+    __atomic_add_fetch(&tessel_state_v2_.taken, 1, __ATOMIC_RELAXED);
+    if (__atomic_load_n(&tessel_state_v2_.stuck, __ATOMIC_RELAXED)) {
+      __atomic_store_n(&tessel_state_v2_.stuck, 0, __ATOMIC_RELAXED);
+    }
   }
   return error;
 }
@@ -379,6 +389,8 @@ void tessel_at_exit_v2_(void) {
   if (tessel_is_ours_(handle)) close((int)(uint32_t)handle);
 }
 #endif
+
+/* NOLINTEND(modernize-use-nullptr) */
 
 #ifdef __cplusplus
 #pragma GCC diagnostic pop

@@ -46,19 +46,18 @@ enum {
 struct tessel_state_v2_ {
   uint64_t socket; /* the descriptor, and above it the low half of its inode number; 0: none */
   uint64_t intervals;
-  uint64_t lost; /* process << TESSEL_COUNT_BITS_ | points that it lost */
-  uint64_t told; /* the greatest such total that the socket took */
-  uint64_t
-      since; /* microseconds of the first loss << TESSEL_SINCE_BITS_ | low bits of the process */
-  uint64_t
-      stuck; /* when the last wait began that ended without room, by tessel_now_ns_(); 0: none */
+  uint64_t lost;  /* process << TESSEL_COUNT_BITS_ | points that it lost */
+  uint64_t told;  /* the greatest such total that the socket took */
+  uint64_t since; /* microseconds of the first loss << TESSEL_SINCE_BITS_ | low bits of process */
+  uint64_t taken; /* points that the socket took, of all threads */
+  uint64_t stuck; /* by tessel_now_ns_(): when a wait began that ended without room; 0: none */
   int mode;
   int wait; /* milliseconds + 1; 0: the environment was not asked yet */
 };
 extern struct tessel_state_v2_ tessel_state_v2_;
 /* NOLINTNEXTLINE(misc-definitions-in-headers): weak */
-__attribute__((weak, visibility("hidden"))) struct tessel_state_v2_ tessel_state_v2_ = {0, 0, 0, 0,
-                                                                                        0, 0, 0, 0};
+__attribute__((weak, visibility("hidden"))) struct tessel_state_v2_ tessel_state_v2_ = {
+    0, 0, 0, 0, 0, 0, 0, 0, 0};
 
 TESSEL_INNER_ uint64_t tessel_now_ns_(void) {
   struct timespec now;

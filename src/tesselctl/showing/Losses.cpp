@@ -86,6 +86,8 @@ void addOverShare(JsonWriter& json, const Losses& losses) {
 void addStore(JsonWriter& json, const StoreReading& reading) {
   const Losses& losses = reading.losses;
   json.member("beyond_pair_limit", losses.sum(LossCode::beyondPairLimit));
+  json.member("lost_at_source", losses.sum(LossCode::lostAtSource));
+  json.member("lost_earlier", losses.sum(LossCode::lostEarlier));
   json.member("without_exe", losses.sum(LossCode::noImagePath));
   json.object("store", [&] {
     json.member("oldest", reading.oldestEntry);
@@ -108,8 +110,6 @@ void addReading(JsonWriter& json, const StoreReading& reading) {
               [&] { json.member("dropped", losses.sum(LossCode::openIntervalDropped)); });
   addStore(json, reading);
   addOverShare(json, losses);
-  json.member("lost_at_source", losses.sum(LossCode::lostAtSource));
-  json.member("lost_earlier", losses.sum(LossCode::lostEarlier));
   json.member("stopped", reading.stopped).member("unread_microseconds", reading.unread());
   json.member("dropped_not_listed", losses.notListed(LossCode::droppedByDaemon));
   json.member("files_read", reading.filesRead);
