@@ -1,0 +1,53 @@
+// One trace object and what became of it, as JSON, as fields for programs, and as lines for people.
+//
+// Stateless but for the layout of the lines; any thread.
+
+#pragma once
+
+#include <string>
+
+#include "journal/EntryStream.h"
+#include "tesselctl/judging/Judge.h"
+#include "tesselctl/reading/TimeArguments.h"
+#include "tesselctl/showing/Terminal.h"
+
+namespace tessel::ctl {
+
+// One trace object and what became of it.
+struct Explanation {
+  const TesselObject& object;
+  const EntryHeader& entry;
+  const FilterDecision& decision;
+  std::string scope;    // the part of the downsampling table that decided; may be empty
+  std::string payload;  // JSON; empty where nothing would be sent or --payload is not given
+};
+
+// One JSON object on a line.
+std::string explanationJson(const Explanation& explanation);
+// One line of fields with tabs between.
+std::string explanationFields(const Explanation& explanation, bool withPayload,
+                              const Terminal& terminal);
+
+// The lines for one object on a terminal: its columns, and below them the reason of the verdict. A
+// long path takes several lines.
+class ExplanationLines {
+ public:
+  ExplanationLines(const Terminal& terminal, const Period& period)
+      : terminal_(terminal), withDay_(period.length() > std::chrono::hours{24}) {}
+
+  std::string heading() const;
+  std::string lines(const Explanation& explanation) const;
+
+ private:
+  // The time, with the day if the period is longer than one day, and a gap of two columns. Within a
+  // day the time alone says which entry is meant.
+  size_t timeWidth() const { return withDay_ ? 16 : 10; }
+  std::string indented(const std::string& text, size_t indent) const {
+    return wrappedBeside(text, terminal_.width, indent) + "\n";
+  }
+
+  const Terminal terminal_;
+  const bool withDay_;
+};
+
+}  // namespace tessel::ctl
