@@ -7,7 +7,7 @@ import random
 import harness
 from harness import MachineTest, point
 from mixed_day import mixed_day
-from model import deliver
+from model import deliver, shortest
 
 ERROR = 1 / 65  # of a quantile, relative
 NANOSECOND = 2**-30
@@ -86,6 +86,32 @@ class Explain(DurationsTest):
         text = self.machine.ctl("explain", "--summary").out
         self.assertTrue("\n40\t0.5\t0.5\t0.5\t0.5\tcom.vantor.Render / Frame / Draw\n" in text)
         self.assertIn(f'{summary["durations_not_listed"]:,} values of further trace points', text.replace("\u202f", ","))
+
+
+class Objects(DurationsTest):
+    def test_each_object_shows_duration_frame_rate_and_process(self):
+        entries = mixed_day(self.machine)[0] + [
+            point("event", "com.vantor.Mail", "Fetch", "Nobody", exe=None, comm=None, pid=None),
+            point("event", "com.vantor.Mail", "Fetch", "User", uid=1000, pid=2_000_000)]
+        self.machine.write_export(entries)
+        shown, things = self.json("explain"), deliver(entries)
+        fields = [line.split("\t") for line in self.machine.ctl("explain").out.splitlines()]
+        self.assertEqual(len(shown), len(things))
+        handed_over = 0
+        for line, thing, field in zip(shown, things, fields):
+            stated = thing.kind != "Event" or thing.get("DURATION") is not None
+            rate = float(thing.get("FRAME_RATE")) if thing.kind == "AnimationInterval" else None
+            self.assertEqual((line.get("duration"), line.get("frame_rate")), (shortest(thing.duration) if stated else None, rate))
+            process = {key: value for key, value in (("name", thing.end.comm), ("image", thing.end.exe), ("pid", thing.end.pid),
+                                                     ("uid", thing.end.uid)) if value is not None}
+            self.assertEqual(line["process"], process)
+            begin = {"name": thing.begin.comm, "image": thing.begin.exe}
+            moved = begin != {"name": thing.end.comm, "image": thing.end.exe}
+            self.assertEqual(line.get("begin_process"), begin if moved else None)
+            handed_over += moved
+            self.assertEqual([float(text) if text else None for text in field[7:9]], [line.get("duration"), line.get("frame_rate")])
+            self.assertEqual(field[9:], [str(process.get(key, "")) for key in ("name", "pid", "uid")])
+        self.assertGreater(handed_over, 0)
 
 
 class Compare(DurationsTest):

@@ -165,7 +165,7 @@ class Pipes(OutputTest):
                 self.assertEqual([line[1], line[2], *map(unescaped, line[3:6])],
                                  [one["verdict"], one["kind"].lower(), one["subsystem"], one["category"], one.get("name", "")])
                 self.assertEqual(("whitelist" in line[1]), unescaped(one.get("rule", {}).get("value", "\t")) in unescaped(line[6]))
-                self.assertEqual(json.loads(line[7]) if line[7] else None, one.get("payload"))
+                self.assertEqual(json.loads(line[-1]) if line[-1] else None, one.get("payload"))
         stamps = sorted(line[0] for line in lines)  # --since takes the time as it is printed
         for stamp in (stamps[0], stamps[-1]):
             self.assertEqual(len(self.lines("explain", "--since", stamp)), sum(stamp <= other for other in stamps))

@@ -67,24 +67,6 @@ bool takesBundleIdOverride(const TesselInterval& interval) {
 
 }  // namespace
 
-// The filter asks this several times for every object. A comparison of two values is cheaper than a
-// dynamic_cast, which looks the class up in the type information.
-bool TesselSupportObject::isKindOf(TesselClass wanted) const {
-  if (class_ == wanted) return true;
-  switch (wanted) {
-    case TesselClass::supportObject:
-      return true;
-    case TesselClass::object:
-      return class_ != TesselClass::supportObject;
-    case TesselClass::interval:
-      return class_ == TesselClass::animationInterval;
-    case TesselClass::event:
-    case TesselClass::animationInterval:
-      return false;
-  }
-  return false;
-}
-
 StringRef TesselInterval::attribute(std::string_view key) const {
   // The begin and the end of an interval bring at most 32 attributes each. A list that short is
   // searched faster than a map is built.

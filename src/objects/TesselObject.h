@@ -36,7 +36,24 @@ class TesselSupportObject {
 
   // True for the object's own class and for every class above it in the tree. An animation
   // interval is also an interval, an object and a support object.
-  bool isKindOf(TesselClass wanted) const;
+  //
+  // Filter and counters ask this several times for every object. So it is a comparison in place,
+  // and not a dynamic_cast, which looks the class up in the type information.
+  bool isKindOf(TesselClass wanted) const {
+    if (class_ == wanted) return true;
+    switch (wanted) {
+      case TesselClass::supportObject:
+        return true;
+      case TesselClass::object:
+        return class_ != TesselClass::supportObject;
+      case TesselClass::interval:
+        return class_ == TesselClass::animationInterval;
+      case TesselClass::event:
+      case TesselClass::animationInterval:
+        return false;
+    }
+    return false;
+  }
 
   virtual bool canGenerateStatoraPayload() const { return false; }
   // The analytics payload, or nothing for a class that has none.

@@ -16,6 +16,7 @@
 
 #include <array>
 #include <memory>
+#include <optional>
 
 #include "journal/EntryStream.h"
 #include "objects/TesselObject.h"
@@ -57,6 +58,12 @@ struct AssemblyCounts {
 // the partner may lie in the day before or after.
 void addLosses(const AssemblyCounts& counts, Losses& losses);
 
+// The process that wrote an entry, as the journal daemon saw it. Either may be absent.
+struct EntryProcess {
+  std::optional<uint32_t> id;
+  std::optional<uint32_t> user;
+};
+
 class IntervalAssembler {
  public:
   // REQUIRES: table, writers and sink outlive the assembler. Nobody else keeps tokens of the table
@@ -72,6 +79,12 @@ class IntervalAssembler {
   AssemblyCounts counts() const;
   // The writer of the current entry. REQUIRES: called by the sink.
   Origin writer() const { return writerOf(table_, point_.tokens); }
+  // The process of the current entry. Objects do not have it: a run needs no more than its name,
+  // and two more values would slow down every object. REQUIRES: called by the sink.
+  EntryProcess process() const {
+    // A process is numbered in 22 bits, so a number that can be a user's can be its own.
+    return {table_.user(point_[FieldKind::process]), table_.user(point_[FieldKind::user])};
+  }
 
  private:
   struct Point {

@@ -91,6 +91,8 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   // The header of the entry that completed the object of the running callback. For an interval that
   // is its end. REQUIRES: a callback is running.
   const EntryHeader& currentEntry() const { return *current_; }
+  // The process that wrote that entry. REQUIRES: a callback is running.
+  EntryProcess currentProcess() const { return assembler_.process(); }
   // The books so far. processLogArchiveWithPath() fills in the store's part when it ends. A caller
   // of processEntries() reads a store of its own and passes that store's report.
   ExtractionReport report() const { return report(report_.store); }

@@ -93,7 +93,11 @@ class ExplainRun {
     tally_.count(object, decision, entry);
     if (options_.summary) return;
     const Explanation explanation{
-        object, entry, decision, judge_.downsamplingScope(object, decision),
+        object,
+        entry,
+        decision,
+        run_.currentProcess(),
+        judge_.downsamplingScope(object, decision),
         payloads_ && decision.shouldReport() ? payloads_->json(object) : ""};
     print(text(explanation));
   }

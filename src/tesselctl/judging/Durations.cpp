@@ -99,10 +99,9 @@ std::vector<QuantileSketch::Bar> QuantileSketch::histogram() const {
 }
 
 void Durations::count(const TesselObject& object) {
-  const bool interval = object.isKindOf(TesselClass::interval);
-  if (!interval && !object.statesDuration()) return;
+  if (!hasDuration(object)) return;
   countValue(object, Measure::duration, object.durationSeconds());
-  if (!interval || !object.isKindOf(TesselClass::animationInterval)) return;
+  if (!object.isKindOf(TesselClass::animationInterval)) return;
   countValue(object, Measure::frameRate,
              static_cast<const TesselAnimationInterval&>(object).frameRate());
 }

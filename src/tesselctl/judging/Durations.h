@@ -81,6 +81,12 @@ struct DurationChange;
 // What a sketch is of.
 enum class Measure : uint8_t { duration, frameRate };
 
+// Whether the duration of an object means anything: an interval has one, and an event that states
+// one.
+inline bool hasDuration(const TesselObject& object) {
+  return object.statesDuration() || object.isKindOf(TesselClass::interval);
+}
+
 // Durations and frame rates by trace point.
 class Durations {
  public:
@@ -92,8 +98,8 @@ class Durations {
   static constexpr size_t kMaxTextBytes = size_t{2} << 20;  // of subsystems, categories and names
   static constexpr size_t kShareOfPair = 8;
 
-  // Counts the duration of an interval, and of an event that states one; of an animation interval
-  // also the frame rate. Other objects cost one comparison and no memory.
+  // Counts the duration of an object that has one, and the frame rate of an animation interval.
+  // Other objects cost two comparisons and no memory.
   void count(const TesselObject& object);
 
   // Makes room for the trace points of an earlier period. Without it a flood in this period could

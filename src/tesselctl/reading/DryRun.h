@@ -36,6 +36,9 @@ class DryRun {
   // an error if the store cannot be opened.
   std::optional<PlatformError> follow(Date start, const std::function<void()>& afterEachLook);
 
+  // The process that wrote the entry which the visitor was given. REQUIRES: the visitor is running.
+  EntryProcess currentProcess() const { return extractor_.currentProcess(); }
+
   // The findings so far. Its facts about the store are those of the last reading.
   ExtractionReport report() const { return extractor_.report(storeReport_); }
 

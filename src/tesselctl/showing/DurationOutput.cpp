@@ -48,12 +48,6 @@ std::string threeDigits(double value) {
   return {text, end.ptr};
 }
 
-// Programs sort and compare, which one unit for all values lets them do.
-std::string plainDigits(float value) {
-  char text[32];  // of a float up to 15
-  return {text, std::to_chars(text, std::end(text), value).ptr};
-}
-
 struct Quantile {
   const char* name;
   double part;  // 0 is the minimum, 1 the maximum
@@ -271,6 +265,11 @@ std::string secondsText(float seconds) {
     if (size >= unit.from) return threeDigits(seconds / unit.seconds) + unit.name;
   }
   return threeDigits(seconds / 1e-9) + " ns";
+}
+
+std::string plainDigits(float value) {
+  char text[32];  // of a float up to 15
+  return {text, std::to_chars(text, std::end(text), value).ptr};
 }
 
 std::string frameRateText(float rate) { return threeDigits(rate) + " fps"; }

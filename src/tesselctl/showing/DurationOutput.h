@@ -16,6 +16,9 @@ namespace tessel::ctl {
 std::string secondsText(float seconds);
 // Frames per second: "59.9 fps".
 std::string frameRateText(float rate);
+// The shortest digits that read back as the same value, without a unit. Programs sort and compare,
+// which one unit for all values lets them do.
+std::string plainDigits(float value);
 
 // Writes the members `durations` in seconds and `frame_rates` in frames per second, each with the
 // count of values that it does not list.

@@ -10,6 +10,7 @@
 #include "tesselctl/judging/Judge.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "tesselctl/showing/Terminal.h"
+#include "trace/IntervalAssembler.h"
 
 namespace tessel::ctl {
 
@@ -18,8 +19,9 @@ struct Explanation {
   const TesselObject& object;
   const EntryHeader& entry;
   const FilterDecision& decision;
-  std::string scope;    // the part of the downsampling table that decided; may be empty
-  std::string payload;  // JSON; empty where nothing would be sent or --payload is not given
+  EntryProcess process;  // that recorded it; of an interval, its end
+  std::string scope;     // the part of the downsampling table that decided; may be empty
+  std::string payload;   // JSON; empty where nothing would be sent or --payload is not given
 };
 
 // One JSON object on a line.
