@@ -24,15 +24,15 @@ namespace {
 // The tables of a summary together fit on a few screens. JSON has all rows.
 constexpr size_t kShownPoints = 20;
 
-struct Unit {
+struct ShownUnit {
   double from;     // the least duration that is shown in it
   double seconds;  // that it has
   const char* name;
 };
 // People count in seconds up to two minutes, and in minutes up to two hours.
-constexpr Unit kUnits[] = {{2 * 86400, 86400, " d"}, {7200, 3600, " h"},
-                           {120, 60, " min"},        {1, 1, " s"},
-                           {1e-3, 1e-3, " ms"},      {1e-6, 1e-6, " us"}};
+constexpr ShownUnit kShownUnits[] = {{2 * 86400, 86400, " d"}, {7200, 3600, " h"},
+                                     {120, 60, " min"},        {1, 1, " s"},
+                                     {1e-3, 1e-3, " ms"},      {1e-6, 1e-6, " us"}};
 
 // Three digits. Above a million the digits before the point would be noise as well.
 std::string threeDigits(double value) {
@@ -261,7 +261,7 @@ std::string changesText(const Style& style, const Durations& a, const Durations&
 std::string secondsText(float seconds) {
   const double size = std::fabs(seconds);
   if (size < 5e-12) return "0 s";  // which nanoseconds with two decimals would show as 0.00
-  for (const Unit& unit : kUnits) {
+  for (const ShownUnit& unit : kShownUnits) {
     if (size >= unit.from) return threeDigits(seconds / unit.seconds) + unit.name;
   }
   return threeDigits(seconds / 1e-9) + " ns";
