@@ -5,9 +5,10 @@ import math
 import random
 
 import harness
-from harness import MachineTest, point
+from harness import point
 from mixed_day import mixed_day
 from model import deliver, shortest
+from output_test import OutputTest
 
 ERROR = 1 / 65  # of a quantile, relative
 NANOSECOND = 2**-30
@@ -26,7 +27,7 @@ def intervals(name, durations, at, pid=4711):
               mono=10**9 + i * 10**7 + round(duration * 1e6), frame_rate=f"{60 - duration:.3f}", pid=pid))]
 
 
-class DurationsTest(MachineTest):
+class DurationsTest(OutputTest):
     def json(self, *arguments):
         result = self.machine.ctl(*arguments, "--json")
         self.assertEqual((result.status, result.errors), (0, ""))
@@ -150,6 +151,16 @@ class Compare(DurationsTest):
         self.assertLess(rates["Worst"]["b"]["p50"], rates["Worst"]["a"]["p50"])
         text = self.machine.ctl(*self.LAST_WEEK).out
         self.assertIn("3 slower, 1 same, 1 faster, 1 few values, 1 only in A, 1 only in B", text)
+
+    def test_a_terminal_shows_both_periods_in_80_columns(self):
+        self.record_two_weeks({"Long" * 20: ([0.0125] * 20, [0.05] * 30), "Three": ([0.001] * 3, [30.0] * 3), "New": ([], [1.0] * 20)})
+        _, out = self.on_terminal(*self.LAST_WEEK, TERM="dumb")
+        self.assertLessEqual(max(map(len, out.splitlines())), 80)
+        self.assertRegex(out, r"\n  4\.00x slower +com\.vantor\.Render / [^,]*Long\n +p50 12\.5 ms -> 50\.0 ms, p95 12\.5 ms -> 50\.0 ms, 20 -> 30 values\n")
+        self.assertRegex(out, r"\n  few values +com\.vantor\.Render / Frame / Three\n +p50 1\.00 ms -> 30\.0 s,")
+        self.assertRegex(out, r"\n  only in B +com\.vantor\.Render / Frame / New\n +p50 1\.00 s, p95 1\.00 s, 20 values\n")
+        _, out = self.on_terminal("explain", "--since", "-4d", "--name", "New", TERM="dumb")
+        self.assertIn("(1.00 s, 59.0 fps, Clock[4711])", " ".join(out.split()))
 
     def test_slower_frames_are_lower_rates(self):
         frames = lambda name, rates, at: [entry for i, rate in enumerate(rates) for entry in (
