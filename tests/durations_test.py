@@ -90,7 +90,7 @@ class Explain(DurationsTest):
 
 
 class Objects(DurationsTest):
-    def test_each_object_shows_duration_frame_rate_and_process(self):
+    def test_each_object_shows_how_long_and_by_whom(self):
         entries = mixed_day(self.machine)[0] + [
             point("event", "com.vantor.Mail", "Fetch", "Nobody", exe=None, comm=None, pid=None),
             point("event", "com.vantor.Mail", "Fetch", "User", uid=1000, pid=2_000_000)]
