@@ -389,7 +389,8 @@ void addCompareCommand(CLI::App& app, Invocation& invocation) {
       ->required()
       ->type_name("");
   addPeriodOptions(command, options.reading);
-  command.add_flag("--json", options.json, "One JSON object: a, b, starts, stops, changes, durations");
+  command.add_flag("--json", options.json,
+                   "One JSON object: a, b, starts, stops, changes, durations");
 }
 
 }  // namespace tessel::ctl
