@@ -13,6 +13,7 @@
 #pragma once
 
 #include <algorithm>
+#include <bit>
 #include <cstdint>
 #include <cstring>
 #include <span>
@@ -56,6 +57,12 @@ class DataMarks {
     explicit Plain(const DataMarks& marks)
         : words_(marks.plain_.data()), size_(marks.plain_.size()) {}
     bool has(uint64_t offset) const { return isSet(words_, size_, offset); }
+    // The same for four at once, with one look at the size of the table: it is a power of two, so
+    // it is greater than all of them if it is greater than their bits together.
+    bool hasAll(uint64_t a, uint64_t b, uint64_t c, uint64_t d) const {
+      return (a | b | c | d) >> kWordShift < size_ && isSet(words_, a) && isSet(words_, b) &&
+             isSet(words_, c) && isSet(words_, d);
+    }
 
    private:
     const uint64_t* words_;
@@ -90,8 +97,10 @@ class DataMarks {
 
   static uint64_t bitOf(uint64_t offset) { return uint64_t{1} << (offset >> kPlaceShift & 63); }
   static bool isSet(const uint64_t* words, size_t size, uint64_t offset) {
-    const uint64_t word = offset >> kWordShift;
-    return word < size && (words[word] >> (offset >> kPlaceShift & 63) & 1) != 0;
+    return offset >> kWordShift < size && isSet(words, offset);
+  }
+  static bool isSet(const uint64_t* words, uint64_t offset) {
+    return (words[offset >> kWordShift] >> (offset >> kPlaceShift & 63) & 1) != 0;
   }
   static uint64_t firstWord(std::string_view text) {
     uint64_t word = 0;
@@ -114,7 +123,7 @@ class DataMarks {
   }
   bool grow(uint64_t word) {
     if (word > kTotal) return false;
-    const auto size = static_cast<size_t>(std::max<uint64_t>(word + word / 2, 64));
+    const auto size = static_cast<size_t>(std::max<uint64_t>(std::bit_ceil(word + 1), 64));
     const size_t more = 2 * (size - plain_.size()) * sizeof(uint64_t);
     if (more > bytesLeft_) return false;
     bytesLeft_ -= more;

@@ -11,28 +11,17 @@
 namespace tessel {
 
 namespace {
-constexpr Id128 kNoId{};
 // all_ merges files and whole sequences. A stream number below this is a file's; one from here on
 // is a sequence's. No store has so many files.
 constexpr uint32_t kFirstSequence = 0x80000000;
 }  // namespace
 
-bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
-  if (sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) &&
-      a.sequenceNumber != b.sequenceNumber)
-    return a.sequenceNumber < b.sequenceNumber;
+bool comesBeforeByTime(const EntryHeader& a, const EntryHeader& b) {
   if (sameId(a.bootId, b.bootId) && a.monotonic != b.monotonic) return a.monotonic < b.monotonic;
   // Hash and boot decide between equal times. Otherwise the order would depend on which file was
   // opened first, and two runs over one store could differ.
   return std::tie(a.realtime, a.contentHash, a.bootId, a.monotonic) <
          std::tie(b.realtime, b.contentHash, b.bootId, b.monotonic);
-}
-
-// The number differs nearly always, so it is compared first and the ids last.
-bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
-  return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
-         a.realtime == b.realtime && a.monotonic == b.monotonic && sameId(a.bootId, b.bootId) &&
-         sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, kNoId) && a.contentHash != 0;
 }
 
 void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
@@ -41,27 +30,13 @@ void EntryMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number) {
   if (source.next()) heap_.push_back(std::move(source));
 }
 
-bool EntryMerger::next() {
-  if (started_ && !heap_.empty()) {
-    // The copies go first: they are compared with the front, so it must not have moved on yet.
-    dropDuplicates();
-    advanceFirst();
-  } else if (!started_) {
-    started_ = true;
-    for (size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
-    runnerUp_ = findRunnerUp();
-  }
-  ++current_;
-  return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+void EntryMerger::start() {
+  if (std::exchange(started_, true)) return;
+  for (size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
+  runnerUp_ = findRunnerUp();
 }
 
-// Files follow one another in time, so the next entry is nearly always from the same stream. We
-// remember which stream comes second: one comparison with it shows that nothing has to move.
-void EntryMerger::advanceFirst() {
-  const bool more = heap_.front().next();
-  if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
-      [[likely]]
-    return;
+void EntryMerger::moveFirst(bool more) {
   if (!more) close(0);
   siftDown(0);
   runnerUp_ = findRunnerUp();
@@ -89,23 +64,16 @@ void EntryMerger::siftDown(size_t index) {
   }
 }
 
-// Skips the copies of the current entry in the other streams. A stream skips at most one: if it has
-// the entry twice, the entry was written twice. A copy compares equal to the front, so in a heap
-// nothing but another copy can stand between them. Therefore we look only at the two places below
-// the front: when we skip a copy there, siftDown() brings up the entry below it.
-void EntryMerger::dropDuplicates() {
-  for (size_t child = 1; child <= 2 && child < heap_.size();) {
-    if (heap_[child].skippedFor == current_ ||
-        !sameEntry(*heap_[child].header, *heap_.front().header)) [[likely]] {
-      ++child;
-      continue;
-    }
-    heap_[child].skippedFor = current_;
-    ++duplicates_;
-    if (!heap_[child].next()) close(child);
-    siftDown(child);
-    runnerUp_ = findRunnerUp();
-  }
+// A stream skips at most one copy: if it has the entry twice, the entry was written twice. False if
+// it skipped one before. Otherwise siftDown() brings up the entry below it.
+bool EntryMerger::skipCopy(size_t child) {
+  if (heap_[child].skippedFor == current_) return false;
+  heap_[child].skippedFor = current_;
+  ++duplicates_;
+  if (!heap_[child].next()) close(child);
+  siftDown(child);
+  runnerUp_ = findRunnerUp();
+  return true;
 }
 
 void StoreMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence) {

@@ -30,11 +30,23 @@
 
 namespace tessel {
 
+// Whether `a` comes before `b`, by the clocks alone.
+bool comesBeforeByTime(const EntryHeader& a, const EntryHeader& b);
 // Whether `a` comes before `b`.
-bool comesBefore(const EntryHeader& a, const EntryHeader& b);
+inline bool comesBefore(const EntryHeader& a, const EntryHeader& b) {
+  if (sameId(a.sequenceId, b.sequenceId) && a.sequenceNumber != b.sequenceNumber &&
+      !sameId(a.sequenceId, Id128{})) [[likely]]
+    return a.sequenceNumber < b.sequenceNumber;
+  return comesBeforeByTime(a, b);
+}
 // Whether both are copies of one entry. False if one has no sequence or no hash: then we cannot
-// tell two copies from two different entries, and delivering an entry twice loses nothing.
-bool sameEntry(const EntryHeader& a, const EntryHeader& b);
+// tell two copies from two different entries, and delivering an entry twice loses nothing. The
+// number differs nearly always, so it is compared first and the ids last.
+inline bool sameEntry(const EntryHeader& a, const EntryHeader& b) {
+  return a.sequenceNumber == b.sequenceNumber && a.contentHash == b.contentHash &&
+         a.realtime == b.realtime && a.monotonic == b.monotonic && sameId(a.bootId, b.bootId) &&
+         sameId(a.sequenceId, b.sequenceId) && !sameId(a.sequenceId, Id128{}) && a.contentHash != 0;
+}
 
 // Merges streams with a heap. It delivers an entry of several streams once, unless the rules above
 // contradict each other for these streams. If one stream has equal entries, it delivers them all:
@@ -50,7 +62,17 @@ class EntryMerger final : public EntryStream {
   // next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
-  bool next() override;
+  bool next() override {
+    if (started_ && !heap_.empty()) [[likely]] {
+      // The copies go first: they are compared with the front, so it must not have moved on yet.
+      dropDuplicates();
+      advanceFirst();
+    } else {
+      start();
+    }
+    ++current_;
+    return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+  }
   const EntryHeader& header() const override { return *heap_.front().header; }
   Entry entry() override { return heap_.front().stream->entry(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
@@ -71,11 +93,29 @@ class EntryMerger final : public EntryStream {
     uint64_t skippedFor = 0;
   };
 
-  void advanceFirst();
+  void start();
+  // Files follow one another in time, so the next entry is nearly always from the same stream. We
+  // remember which stream comes second: one comparison with it shows that nothing has to move.
+  void advanceFirst() {
+    const bool more = heap_.front().next();
+    if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
+        [[likely]]
+      return;
+    moveFirst(more);
+  }
+  void moveFirst(bool more);
   void close(size_t index);
   size_t findRunnerUp() const;
   void siftDown(size_t index);
-  void dropDuplicates();
+  // Skips the copies of the current entry in the other streams. A copy compares equal to the front,
+  // so in a heap nothing but another copy can stand between them. Therefore we look only at the two
+  // places below the front.
+  void dropDuplicates() {
+    for (size_t child = 1; child <= 2 && child < heap_.size(); ++child)
+      while (child < heap_.size() && sameEntry(*heap_[child].header, *heap_.front().header))
+        [[unlikely]] if (!skipCopy(child)) break;
+  }
+  bool skipCopy(size_t child);
 
   const StopFlag& stop_;
   uint64_t& duplicates_;

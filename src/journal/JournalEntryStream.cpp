@@ -139,9 +139,16 @@ size_t JournalEntryStream::collectTokens() {
 template <typename Item>
 bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
   DataMarks::Plain plain(marks_);
-  for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
-       item += kStep<Item>) {
-    const uint64_t offset = load<Item>(item);
+  const auto at = [](const uint8_t* item, size_t ahead) -> uint64_t {
+    return load<Item>(item + ahead * kStep<Item>);
+  };
+  const uint8_t* item = items;
+  const uint8_t* const end = items + count * kStep<Item>;
+  for (const uint8_t* last = end - count % 4 * kStep<Item>; item != last; item += 4 * kStep<Item>)
+    if (!plain.hasAll(at(item, 0), at(item, 1), at(item, 2), at(item, 3))) [[unlikely]]
+      break;
+  for (; item != end; item += kStep<Item>) {
+    const uint64_t offset = at(item, 0);
     if (plain.has(offset)) [[likely]]
       continue;
     if (isMark(offset)) return true;
