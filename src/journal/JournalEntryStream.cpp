@@ -182,10 +182,15 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   FieldToken* const tokens = context_.resources.tokens.data();
   FieldToken* kept = tokens;
   uint32_t hash = 0;
+  // The objects from here to the entry were written for it, and it has not named them yet. So
+  // nothing is remembered of them.
+  uint64_t fresh = walk_.firstFresh();
   for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
        item += kStep<Item>) {
     const uint64_t offset = load<Item>(item);
-    const TokenCache::Value* known = TokenCache::takes(offset) ? cache.findAtOnce(offset) : nullptr;
+    const bool isNew = offset >= fresh && offset < walk_.offset();
+    const TokenCache::Value* known =
+        !isNew && TokenCache::takes(offset) ? cache.findAtOnce(offset) : nullptr;
     TokenCache::Value value;
     if (known != nullptr) [[likely]] {
       value = *known;
@@ -193,7 +198,8 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
       // We look at the flag here and not for each field: only a miss reads and decompresses, which
       // can take long.
       if (stopped()) return static_cast<size_t>(kept - tokens);
-      value = rememberedOrNew(offset);
+      value = isNew ? newTokenAt(offset) : rememberedOrNew(offset);
+      if (isNew) fresh = offset + 1;
     }
     *kept = value.token;
     kept += value.token != kNoToken;
@@ -205,11 +211,8 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   return static_cast<size_t>(kept - tokens);
 }
 
-// An object that was written for this entry is new, and the cache need not be asked.
 TokenCache::Value JournalEntryStream::rememberedOrNew(uint64_t offset) {
-  const uint64_t fresh = walk_.firstFresh();
-  if (!TokenCache::takes(offset) || offset - fresh < walk_.offset() - fresh)
-    return newTokenAt(offset);
+  if (!TokenCache::takes(offset)) return newTokenAt(offset);
   const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
   const TokenCache::Value* known = cache.find(offset);
   return known != nullptr ? *known : newTokenAt(offset);

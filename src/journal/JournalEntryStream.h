@@ -90,7 +90,7 @@ class JournalEntryStream final : public EntryStream {
   template <typename Item>
   size_t intactTokensOf(const uint8_t* items, size_t count);
   [[gnu::noinline]] TokenCache::Value rememberedOrNew(uint64_t offset);
-  TokenCache::Value newTokenAt(uint64_t offset);
+  [[gnu::noinline]] TokenCache::Value newTokenAt(uint64_t offset);
   void remember(uint64_t offset, const DataObject& data, TokenCache::Value value);
   std::optional<Text> textAt(uint64_t offset, DataObject& data);
   FieldToken tokenOf(const Text& text);

@@ -114,9 +114,9 @@ class TokenCache {
     uint32_t firstLine_;
   };
 
-  // 512 KiB, for 40,960 values. A stretch has 64 bytes, so only one object begins in it: the values
+  // 256 KiB, for 20,480 values. A stretch has 64 bytes, so only one object begins in it: the values
   // of one program stand beside one another and recur together, and one line could not hold them.
-  static constexpr int kRecurringLineBits = 13;
+  static constexpr int kRecurringLineBits = 12;
   static constexpr int kRecurringStretchBits = 3;
   // 1 MiB, for 81,920 values. The shortest entry with a value of its own takes some 300 bytes, so
   // no more than four such values share a stretch of 1 KiB.

@@ -149,9 +149,11 @@ void IntervalAssembler::emitEvent() {
 }
 
 void IntervalAssembler::begin(const EntryHeader& header) {
-  const bool replaced =
+  const auto [place, replaced] =
       open_.open(keyOf(header), writerNumber(), header.monotonic, point_.tokens, point_.attributes);
   if (replaced) ++counts_.replacedBegins;
+  // The end has the same id, and so nearly always the same token.
+  table_.setNumberOn(point_[FieldKind::intervalId], place);
 }
 
 // Few writers make nearly all begins. A comparison of tokens costs a third of reading their values.
@@ -168,7 +170,8 @@ uint32_t IntervalAssembler::writerNumber() {
 }
 
 void IntervalAssembler::end(const EntryHeader& header) {
-  const OpenInterval* begin = open_.find(keyOf(header));
+  const OpenInterval* begin =
+      open_.find(keyOf(header), table_.numberOn(point_[FieldKind::intervalId]));
   if (begin == nullptr) {
     ++counts_.unmatchedEnds;
     return;

@@ -58,14 +58,18 @@ class Turns {
 
 }  // namespace
 
+// All memory is reserved at once, so the begins need not move. Pages that nobody touches cost
+// nothing.
 OpenIntervals::OpenIntervals(Writers& writers, OpenIntervalLimits limits)
-    : writers_(writers), limits_(limits), intervals_(writers), attributes_(writers) {}
+    : writers_(writers), limits_(limits), intervals_(writers), attributes_(writers) {
+  nodes_.reserve(limits.intervals + 1);
+}
 
 uint32_t OpenIntervals::numberOf(const IntervalKey& key, uint32_t hash) const {
   return index_.find(hash, [&](uint32_t number) { return nodes_[number].key == key; });
 }
 
-const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
+const OpenInterval* OpenIntervals::search(const IntervalKey& key) const {
   const uint32_t number = numberOf(key, hashOf(key));
   return number == kNone ? nullptr : &nodes_[number];
 }
@@ -74,8 +78,9 @@ const OpenInterval* OpenIntervals::find(const IntervalKey& key) const {
 // the attributes of the old one use up none of the limit. If everyone else holds less, even the new
 // interval goes; one entry has at most 32 attributes, so only a limit below 32, as a test may set,
 // can be exceeded by a single interval, which then stays.
-bool OpenIntervals::open(const IntervalKey& key, uint32_t writer, uint64_t monotonic,
-                         const PointTokens& tokens, const std::vector<FieldToken>& attributes) {
+OpenIntervals::Opened OpenIntervals::open(const IntervalKey& key, uint32_t writer,
+                                          uint64_t monotonic, const PointTokens& tokens,
+                                          const std::vector<FieldToken>& attributes) {
   const uint32_t hash = hashOf(key);
   const uint32_t replaced = numberOf(key, hash);
   if (replaced != kNone) remove(replaced);
@@ -85,6 +90,7 @@ bool OpenIntervals::open(const IntervalKey& key, uint32_t writer, uint64_t monot
   node.monotonic = monotonic;
   node.tokens = tokens;
   node.attributes = attributes;
+  node.isOpen = true;
   node.hash = hash;
   node.writer = writer;
   link(number);
@@ -92,7 +98,7 @@ bool OpenIntervals::open(const IntervalKey& key, uint32_t writer, uint64_t monot
   while (size() > limits_.intervals) drop(ends_[intervals_.greatest()].oldest);
   while (attributes_.total() > limits_.attributes && size() > 1)
     drop(ends_[attributes_.greatest()].oldest);
-  return replaced != kNone;
+  return {number, replaced != kNone};
 }
 
 // The place of a node in the slab is its number, so close() needs no second search by key.
@@ -145,6 +151,7 @@ void OpenIntervals::release(uint32_t number) {
   intervals_.change(node.writer, -1);
   if (!node.attributes.empty())
     attributes_.change(node.writer, -static_cast<int64_t>(node.attributes.size()));
+  node.isOpen = false;
   node.attributes = std::vector<FieldToken>();  // clear() would keep the memory of each free node
   node.older = std::exchange(free_, number);
 }

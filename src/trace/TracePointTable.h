@@ -83,6 +83,12 @@ class TracePointTable final : public FieldTokenizer {
   // absent value has it.
   bool noted(FieldToken token) const { return at(token).noted; }
   void note(FieldToken token) { contents_.fields[indexOf(token)].noted = true; }
+  // A number that the user of the table may set on a value. It lasts as long as the token. 0 if
+  // none was set.
+  uint32_t numberOn(FieldToken token) const { return at(token).userNumber; }
+  void setNumberOn(FieldToken token, uint32_t number) {
+    contents_.fields[indexOf(token)].userNumber = number;
+  }
   // Whether the value of `token` comes after that of `other`: texts in the order of their bytes,
   // numbers in that of their values, words in that of their table, and a text after a number.
   // REQUIRES: both are of one kind, which is neither an attribute nor malformed.
@@ -122,6 +128,7 @@ class TracePointTable final : public FieldTokenizer {
     FieldKind kind = FieldKind::malformed;
     Form form = Form::none;
     bool noted = false;
+    uint32_t userNumber = 0;
 
     // The pool keeps one record for equal texts, so the address of the record identifies the text.
     uint64_t identity() const {

@@ -23,6 +23,15 @@ TEST_F(OpenIntervalsTest, theOldestOpenIntervalGoes) {
   EXPECT_EQ(run({"end|INTERVAL_ID=1", "end|INTERVAL_ID=3", "end|INTERVAL_ID=4"}).size(), 3u);
 }
 
+// The place that an id remembers is then that of another interval.
+TEST_F(OpenIntervalsTest, intervalsOfOneIdAndInReusedPlacesMeetTheirOwnEnds) {
+  run({"begin|INTERVAL_ID=x|NAME=a", "begin|INTERVAL_ID=x|NAME=b"});
+  EXPECT_EQ(run({"end|INTERVAL_ID=x|NAME=a"}).size(), 1u);
+  EXPECT_THAT(run({"begin|INTERVAL_ID=y|NAME=a", "end|INTERVAL_ID=x|NAME=a"}), IsEmpty());
+  EXPECT_THAT(run({"end|INTERVAL_ID=z|NAME=a"}), IsEmpty());
+  EXPECT_EQ(run({"end|INTERVAL_ID=x|NAME=b", "end|INTERVAL_ID=y|NAME=a"}).size(), 2u);
+}
+
 TEST_F(OpenIntervalsTest, openAttributesAreBounded) {
   openLimits.attributes = 3;
   run({"begin|INTERVAL_ID=1|ATTRIBUTE=a=1|ATTRIBUTE=b=2",
