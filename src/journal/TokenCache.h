@@ -4,7 +4,7 @@
 // Without it each field of each entry would cost a read and a lookup. One cache serves all files of
 // a store, so its size does not depend on the files. A table of all data objects would have no
 // bound. If the cache has forgotten a token, the reader reads the data object and shows it to the
-// tokenizer again. If the object lies far back, that costs a system call: as much as 20 entries.
+// tokenizer again. If the object lies far back, that costs a system call: as much as ten entries.
 //
 // There are two tables, because two kinds of values are remembered for different reasons. A value
 // that recurs is asked for in nearly every entry. All such values of a day fit into a small table,
@@ -15,7 +15,7 @@
 // Both tables are made of lines, as long as a line of the processor's cache. A stretch of the file
 // selects a line, and so neighbours in the file have neighbouring lines. A hash would spread them,
 // but ids are stored in the order of the file and asked for in nearly the same order. The line of
-// an id has several ids that come soon after it, so half of the looks into main memory are spared.
+// an id has several ids that come soon after it, so they share one look into main memory.
 // Each line has five slots. What was stored or found last stands first; a new value pushes out the
 // last.
 //
@@ -118,8 +118,8 @@ class TokenCache {
   // of one program stand beside one another and recur together, and one line could not hold them.
   static constexpr int kRecurringLineBits = 12;
   static constexpr int kRecurringStretchBits = 3;
-  // 1 MiB, for 81,920 values. The shortest entry with a value of its own takes some 300 bytes, so
-  // no more than four such values share a stretch of 1 KiB.
+  // 1 MiB, for 81,920 values: more than may be open at once. The shortest entry with a value of its
+  // own takes some 200 bytes, so a stretch of 1 KiB has no more than five such values.
   static constexpr int kAwaitedLineBits = 14;
   static constexpr int kAwaitedStretchBits = 7;
 
