@@ -33,13 +33,19 @@ SourceLosses::Counter& SourceLosses::add(const Counter& fresh) {
   return counters_.back();
 }
 
-// The writer is no part of what tells counters apart: the last entry of a process is often read
-// when the process has gone, and then nobody knows its executable. It counts for the writer of the
-// entry before.
+// Without a time only the writer tells apart two processes that had one number. Otherwise a user
+// could wait for the number of another's process, and add to what that one told.
+uint64_t SourceLosses::standInOf(const Origin& writer) {
+  constexpr uint64_t kOdd = 0x9e3779b97f4a7c15u;  // spreads the users over all bits
+  return writer.image.hash() ^ (writer.user ? *writer.user + uint64_t{1} : 0) * kOdd;
+}
+
+// The writer is no part of what tells dated counters apart: the last entry of a process is often
+// read when the process has gone, and then nobody knows its executable. It counts for the writer of
+// the entry before.
 SourceLosses::Counter& SourceLosses::counterOf(const ToldLosses& told) {
   const bool dated = told.since != 0;
-  Counter wanted{told.boot, told.process, dated ? told.since : told.writer.image.hash(), 0,
-                 0,         dated};
+  Counter wanted{told.boot, told.process, dated ? told.since : standInOf(told.writer), 0, 0, dated};
   uint32_t known = find(wanted);
   if (known != FlatIndex::kNone) return counters_[known];
   wanted.writer = writers_.numberOf(told.writer);

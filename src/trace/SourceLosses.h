@@ -60,7 +60,7 @@ class SourceLosses {
   struct Counter {
     Id128 boot;
     uint64_t process;
-    uint64_t since;  // where the entry does not say, the hash of the executable stands for it
+    uint64_t since;  // if the entry does not say: standInOf() its writer
     uint64_t total;  // the greatest so far
     uint32_t writer;
     bool dated;  // whether `since` is a time
@@ -69,6 +69,7 @@ class SourceLosses {
   static constexpr uint64_t kAllOthers = uint64_t{1} << 63;
 
   Counter& counterOf(const ToldLosses& told);
+  static uint64_t standInOf(const Origin& writer);
   uint32_t find(const Counter& wanted) const;
   Counter& add(const Counter& fresh);
   static uint32_t hashOf(const Counter& counter);

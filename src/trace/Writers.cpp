@@ -3,7 +3,7 @@
 #include "trace/Writers.h"
 
 #include <algorithm>
-#include <numeric>
+#include <functional>
 
 #include "platform/Invariant.h"
 #include "platform/Text.h"
@@ -86,21 +86,28 @@ LossPlace Writers::placeFor(const Writer& writer) const {
 }
 
 // The list keeps the first losses of a code apart and sums up the others. So the writers who lost
-// most come first. A sort of them all is not needed: at most that many are told apart.
+// most come first. But what a program tells of itself may be a lie, and one user can run many
+// programs that lie. So for these codes each user comes once before any comes twice.
 void Writers::addLosses(LossCode code, Losses& losses) const {
   const size_t index = indexOf(code);
   if (sums_[index] == 0) return;
-  std::vector<const Writer*> losers;
+  struct Loser {
+    const Writer* writer;
+    size_t round = 0;
+  };
+  std::vector<Loser> losers;
   for (const Writer& writer : writers_) {
-    if (writer.lost[index] != 0) losers.push_back(&writer);
+    if (writer.lost[index] != 0) losers.push_back({&writer});
   }
-  const auto listed =
-      losers.begin() + static_cast<std::ptrdiff_t>(std::min(losers.size(), Losses::kMaxOfACode));
-  std::partial_sort(losers.begin(), listed, losers.end(), [&](const Writer* a, const Writer* b) {
-    return a->lost[index] > b->lost[index];
-  });
-  for (const Writer* writer : losers)
-    losses.add(code, kWords[index], placeFor(*writer), writer->lost[index]);
+  std::ranges::stable_sort(losers, std::greater{},
+                           [index](const Loser& loser) { return loser.writer->lost[index]; });
+  if (!isOverShare(code)) {
+    std::vector<size_t> ofUser(users_.size());
+    for (Loser& loser : losers) loser.round = ofUser[loser.writer->user]++;
+    std::ranges::stable_sort(losers, {}, &Loser::round);
+  }
+  for (const Loser& loser : losers)
+    losses.add(code, kWords[index], placeFor(*loser.writer), loser.writer->lost[index]);
 }
 
 void Ranking::put(size_t place, uint32_t holder) {
