@@ -320,6 +320,16 @@ class Examples(unittest.TestCase):
                                env={**CLEAN, "PKG_CONFIG_PATH": os.path.join(prefix, "share/pkgconfig")}).stdout.split()
         subprocess.run(["cc", "-std=c11", "-Werror", *flags, os.path.join(shipped, "record.c"), "-o", prefix + "/c"], check=True)
 
+    def test_the_header_builds_without_warnings(self):
+        strict = "-O1 -Wall -Wextra -pedantic -Wshadow -Wconversion -Werror -c -o /dev/null -I".split() + [os.path.join(ROOT, "include")]
+        for compiler, standard, example in (("gcc", "c11", "record.c"), ("clang-14", "c11", "record.c"), ("g++", "c++17", "record.cpp"),
+                                            ("clang++-14", "c++17", "record.cpp"), ("g++", "c++20", "record.cpp")):
+            for disabled in ([], ["-DTESSEL_TRACE_DISABLED"]):
+                source = os.path.join(ROOT, "examples", example)
+                result = subprocess.run([compiler, "-std=" + standard, *strict, *disabled, source], capture_output=True, text=True,
+                                        check=False)
+                self.assertEqual((result.returncode, result.stderr), (0, ""), (compiler, standard, disabled))
+
     def test_an_old_standard_is_one_error(self):
         source = os.path.join(self.directory, "program.c")
         with open(source, "w", encoding="ascii") as file:
