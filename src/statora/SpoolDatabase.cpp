@@ -29,13 +29,11 @@
 #include <limits>
 #include <utility>
 
+#include "statora/SpoolShares.h"
+
 namespace tessel {
 
 namespace {
-
-// Pages that an insert may write beside those of the row: where a page of the tree is split, and
-// the table that remembers the last id.
-constexpr int64_t kPagesBesideRow = 3;
 
 // The patience of one insert. The rows wait in memory and are tried again each second, so a long
 // wait would win nothing.
@@ -48,40 +46,11 @@ constexpr int kPagesVacuumedAtOnce = 256;
 // Pages of delivered rows that are cleared at once: some more than a transaction of usual rows
 // needs, so that few transactions have to clear any, and few enough for a log that cannot grow.
 constexpr int64_t kPagesClearedAtOnce = 32;
+// A disk with less than this to spare is low: a few transactions of the longest rows.
+constexpr uint64_t kLowDisk = uint64_t{4} << 20;
 // Rows stand in the order of sending. Where the clock was set, old rows may stand behind newer
 // ones, so the search goes on for so many rows. To read the whole spool would take seconds.
 constexpr int64_t kNewerRowsLookedAt = 16384;
-
-// A run may take an eighth of what is free when it begins. So each run that floods the spool leaves
-// seven eighths of what it has found to the next one. The price is that a run's part shrinks: after
-// 30 floods in a row, when the rows of the first are past their days, a run may still take 2.3 MiB
-// of a spool of 1 GiB. A spool of 4 MiB has no room for objects after 17. An eighth of the limit
-// was discarded, because the floods of eight days would fill the spool for a month.
-constexpr int64_t kRunShare = 8;
-
-// Pages that the rows of the summary need: one row of statistics, shorter than a page, and at most
-// 30 counts. A count whose subsystem and category are as long as they may be takes 13 pages. Where
-// 30 of these would be more than an eighth of what the run may take, an eighth is kept for them.
-constexpr int64_t kForStatistics = 2 + kPagesBesideRow;
-constexpr int64_t kMostForCounts = 30 * 13;
-constexpr int64_t kLeastForCounts = 8;
-
-// Pages that a row must leave free, for those of a higher rank.
-int64_t pagesKeptFrom(EventRank rank, int64_t pagesOfRun) {
-  if (rank == EventRank::statistics) return 0;
-  if (rank == EventRank::count) return kForStatistics;
-  return kForStatistics + std::clamp(pagesOfRun / 8, kLeastForCounts, kMostForCounts);
-}
-
-// Pages that a run may take of so many that are free. Even in a full spool the summary may use what
-// is kept for it; nothing is left to the objects then.
-int64_t shareOf(int64_t freePages) {
-  return std::max(freePages / kRunShare, kForStatistics + kLeastForCounts);
-}
-
-int64_t pagesForObjects(int64_t pagesOfRun) {
-  return pagesOfRun - pagesKeptFrom(EventRank::object, pagesOfRun);
-}
 
 }  // namespace
 
@@ -144,9 +113,11 @@ SqliteStatus SpoolDatabase::open() {
   std::filesystem::create_directories(directory_, ignored);
   SqliteStatus status = openSpoolDatabase(database_, path_, static_cast<int>(patience_.count()));
   if (!status.ok()) return status;
-  // journal_size_limit cuts the log's file down after a reader let it grow.
-  status = database_.execute("PRAGMA synchronous=NORMAL; PRAGMA journal_size_limit=" +
-                             std::to_string(checkpointPages_ * kSpoolPageBytes));
+  // journal_size_limit cuts the log's file down after a reader let it grow. secure_delete=FAST
+  // does not write a page only to clear it; the page is soon used again or given back.
+  status = database_.execute(
+      "PRAGMA synchronous=NORMAL; PRAGMA secure_delete=FAST; PRAGMA journal_size_limit=" +
+      std::to_string(checkpointPages_ * kSpoolPageBytes));
   if (!status.ok()) return status;
   logPages_ = 0;
   nextCheckpoint_ = checkpointPages_;
@@ -183,12 +154,44 @@ int64_t SpoolDatabase::deliveredPages() {
   return static_cast<int64_t>(delivered_.bytes()) / kSpoolPageBytes;
 }
 
-// On a full disk the delivered rows go first. Each round gives a little of their space back to the
-// file system and inserts the same rows again.
+// Whether the disk could not take the log as new pages of the database, or little more. A file
+// system that does not say is not low.
+bool SpoolDatabase::diskIsLow() {
+  std::error_code unknown;
+  const auto space = std::filesystem::space(directory_, unknown);
+  return !unknown &&
+         space.available < kLowDisk + static_cast<uint64_t>(logPages_) * kSpoolPageBytes;
+}
+
+// On a full disk the delivered rows go first. That must begin before it is full: a removal is
+// written into the log, and the log can neither grow then nor move into a database that grows. So
+// on a disk that is low, new rows get the pages of delivered ones, and the log is emptied after
+// each transaction. Then neither file grows.
 SqliteStatus SpoolDatabase::insert(std::span<PendingRow> rows) {
+  if (isOpen() && delivered_.bytes() != 0 && diskIsLow()) {
+    clearPages(rows);
+    nextCheckpoint_ = 0;
+  }
   SqliteStatus status = insertOnce(rows);
-  while (status.primaryCode() == SQLITE_FULL && clearDisk()) status = insertOnce(rows);
+  // It may be full for us alone, by a quota.
+  while (status.primaryCode() == SQLITE_FULL && clearPages(rows)) status = insertOnce(rows);
   return status;
+}
+
+// Makes as many free pages as the rows need. False if it has removed nothing for that.
+bool SpoolDatabase::clearPages(std::span<const PendingRow> rows) {
+  if (!isOpen() || !delivered_.open()) return false;
+  int64_t needed = kPagesClearedAtOnce;
+  for (const PendingRow& row : rows)
+    needed +=
+        static_cast<int64_t>(spaceOfRow(row.textBytes()) + kSpoolPageBytes - 1) / kSpoolPageBytes;
+  bool removed = false;
+  while (freePages_.value() < needed) {
+    checkpoint();
+    if (delivered_.removeOldest(kPagesClearedAtOnce * kSpoolPageBytes).value_or(0) == 0) break;
+    removed = true;
+  }
+  return removed;
 }
 
 SqliteStatus SpoolDatabase::insertOnce(std::span<PendingRow> rows) {
@@ -207,17 +210,6 @@ SqliteStatus SpoolDatabase::insertOnce(std::span<PendingRow> rows) {
       std::count_if(rows.begin(), rows.end(), [](const PendingRow& row) { return !row.refused; }));
   if (logPages_ >= nextCheckpoint_) checkpoint();
   return {};
-}
-
-// A removal needs room in the log, which cannot grow. So the log begins anew, in the blocks that it
-// has, and the step is a small one.
-bool SpoolDatabase::clearDisk() {
-  if (!isOpen() || !delivered_.open()) return false;
-  checkpoint();
-  if (delivered_.removeOldest(kPagesClearedAtOnce * kSpoolPageBytes).value_or(0) == 0) return false;
-  giveSpaceBack([] {});
-  checkpoint();  // it shortens the file
-  return true;
 }
 
 SqliteStatus SpoolDatabase::insertEach(std::span<PendingRow> rows) {

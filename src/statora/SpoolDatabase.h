@@ -91,7 +91,8 @@ class SpoolDatabase {
   void forgetStatements();
   SqliteStatus insertOnce(std::span<PendingRow> rows);
   SqliteStatus insertEach(std::span<PendingRow> rows);
-  bool clearDisk();
+  bool diskIsLow();
+  bool clearPages(std::span<const PendingRow> rows);
   int64_t pagesOfRun();
   int64_t usedPages();
   int64_t deliveredPages();
