@@ -173,12 +173,12 @@ class Pipes(OutputTest):
         rows = self.objects("events")
         lines = [line.split("\t") for line in self.lines("events")]
         self.assertEqual([(line[0], unescaped(line[2])) for line in lines], [(str(row["id"]), row["name"]) for row in rows])
-        self.assertEqual({len(line) for line in lines}, {4})
+        self.assertEqual({len(line) for line in lines}, {6})
         self.assertEqual(sum("week" in line for line in self.lines("events")), 42)
         for line, row in zip(lines, rows):
             for key, value in row["payload"].items():
                 if key not in ("Subsystem", "Category", "Name"):
-                    self.assertIn(f"{key}={value}" if isinstance(value, str) else f"{key}=", unescaped(line[3]))
+                    self.assertIn(f"{key}={value}" if isinstance(value, str) else f"{key}=", unescaped(line[5]))
 
     def test_tables_are_lines_of_fields(self):
         summary = self.objects("explain", "--summary")[0]

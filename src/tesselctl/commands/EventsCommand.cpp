@@ -25,12 +25,18 @@ struct EventsOptions {
   size_t newest = 0;  // 0: all
   bool follow = false;
   bool json = false;
+  bool sent = false;
+  bool waiting = false;
   std::optional<std::string> id;  // of `events show`
 
   // Whether the options choose among the rows.
   bool choose() const {
     return period.given() || !names.empty() || !subsystems.empty() || !categories.empty() ||
-           newest != 0 || follow;
+           newest != 0 || follow || sent || waiting;
+  }
+  SpoolRows rows() const {
+    if (sent) return SpoolRows::delivered;
+    return waiting ? SpoolRows::waiting : SpoolRows::all;
   }
 };
 
@@ -43,8 +49,10 @@ class RowSelection {
   RowSelection(const EventsOptions& options, std::optional<Period> period)
       : options_(options), period_(period) {}
 
-  bool wants(const SpooledEvent& row) const {
-    const Date date{std::chrono::microseconds{row.time}};
+  bool wants(const SpoolRow& stored) const {
+    const SpooledEvent& row = stored.event;
+    // Whoever asks for what was sent yesterday means the day on which it left the machine.
+    const Date date{std::chrono::microseconds{options_.sent ? stored.delivery->at : row.time}};
     // The end is not in the period, so two periods that touch never share a row.
     if (period_ && (date < period_->start || date >= period_->end)) return false;
     if (!fitsOne(options_.names, row.name)) return false;
@@ -79,6 +87,8 @@ class EventsRun {
       return complain(state);
     } else if (!show()) {
       return complain(SpoolReader::State::damaged);
+    } else {
+      showTotals();
     }
     return options_.follow ? follow() : kDone;
   }
@@ -96,6 +106,16 @@ class EventsRun {
   }
 
  private:
+  // In a pipe each line is a row, so the totals go to standard error.
+  void showTotals() {
+    if (options_.json) return;
+    const auto contents = spool_.contents();
+    if (!contents) return;  // damaged since the last row was read; nothing is known
+    const std::string totals = eventTotals(*contents, spool_.deliveries());
+    terminal_.interactive ? print(terminal_.paint(Colour::faint, totals)) : printError(totals);
+    flushOutput();
+  }
+
   std::string heldIds() {
     const auto ids = spool_.ids();
     return ids ? "its ids go from " + std::to_string(ids->first) + " to " +
@@ -125,7 +145,7 @@ class EventsRun {
   bool show() {
     std::deque<std::string> last;
     const bool limited = options_.newest != 0;
-    const bool read = spool_.readNew([&](const SpooledEvent& row) {
+    const bool read = spool_.readNew(options_.rows(), [&](const SpoolRow& row) {
       if (!selection_.wants(row)) return;
       std::string line = options_.json ? eventJson(row) : eventLine(row, terminal_);
       if (!limited || followed_) {
@@ -194,12 +214,16 @@ int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
 
 const CommandText kEvents{
     "events", "Show what the spool holds, newest last",
-    "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event sent, "
-    "in\n"
-    "order. On a terminal '~' stands for 'com.vantor.performance.'. In a pipe a row is one line,\n"
-    "with tabs between id, time, name and payload. Patterns may hold * and ?.\n\n"
+    "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event that\n"
+    "the service sent, in order. A row waits until a forwarder has delivered it. Then it stays "
+    "for\n"
+    "7 days, or less where room is needed, with the time and the destination. On a terminal '~'\n"
+    "stands for 'com.vantor.performance.'. In a pipe a row is one line, with tabs between id, "
+    "time,\n"
+    "name, time of delivery, destination and payload. Patterns may hold * and ?.\n\n"
     "Examples:\n"
     "  tesselctl events -n 20\n"
+    "  tesselctl events --sent --since yesterday --until today\n"
     "  tesselctl events show 42\n"
     "  tesselctl events | grep -c period=week\n"
     "  tesselctl events --name com.vantor.performance.tessel_reporting_stats --json\n"
@@ -220,8 +244,13 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
   addPatterns(command, "--category", options.categories,
               "Only payloads of this category; may be repeated");
   command.add_option("-n,--newest", options.newest, "Only so many, the newest")->type_name("COUNT");
+  auto* const sent = command.add_flag(
+      "--sent", options.sent,
+      "Only what was delivered; --since, --until and --last then mean the time of delivery");
+  command.add_flag("--waiting", options.waiting, "Only what waits for delivery")->excludes(sent);
   command.add_flag("--follow", options.follow, "Go on with what is sent from now on");
-  command.add_flag("--json", options.json, "One JSON object a line: id, time, name, payload");
+  command.add_flag("--json", options.json,
+                   "One JSON object a line: id, time, name, state, payload");
   CLI::App* show = command.add_subcommand("show", "Show one row whole, its payload laid out");
   show->add_option("ID", options.id, "The id of the row, as 'tesselctl events' shows it")
       ->required()

@@ -52,6 +52,7 @@ SpoolReader::State SpoolReader::open() {
   if (database_.isOpen() && sameFile()) return State::open;
   database_.close();
   lastId_ = 0;
+  lastNumber_ = 0;
   failure_ = {};
   struct stat facts {};
   if (::lstat(path_.c_str(), &facts) != 0) {
@@ -98,38 +99,99 @@ bool SpoolReader::damaged() const {
 
 bool SpoolReader::locked() const { return failure_.primaryCode() == SQLITE_BUSY; }
 
-bool SpoolReader::readNew(const std::function<void(const SpooledEvent&)>& visit) {
-  failure_ = {};
-  SqliteStatement select = database_.prepare(kSelectEvents);
-  while (select.prepared()) {
-    const auto page = readEvents(select, lastId_, kRowsOfAPage, kBytesOfAPage);
-    // The visitor is no client of this database, so the status is still that of the reading.
-    failure_ = database_.status();
-    for (const SpooledEvent& row : page) visit(row);
-    if (!page.empty()) lastId_ = page.back().id;
-    if (!failure_.ok()) break;
-    if (page.empty()) return true;
+// Without the table no forwarder has kept a row yet.
+std::vector<DeliveredEvent> SpoolReader::deliveredRows(const std::string& select, int64_t bound,
+                                                       size_t rows) {
+  SqliteStatement statement = database_.prepare(select);
+  std::vector<DeliveredEvent> page;
+  if (statement.prepared()) page = readDelivered(statement, bound, rows, kBytesOfAPage);
+  failure_ = database_.status();
+  if (!statement.prepared() && failure_.primaryCode() == SQLITE_ERROR) failure_ = {};
+  return page;
+}
+
+// The next rows that were not visited. Absent at the end, and where reading fails. Both tables are
+// read in one transaction: a row that is delivered between two would be seen in neither.
+std::optional<std::vector<SpoolRow>> SpoolReader::nextPage(SpoolRows wanted) {
+  std::vector<SpoolRow> rows;
+  if (wanted != SpoolRows::waiting) {
+    const auto page = deliveredRows(kSelectDelivered, lastNumber_, kRowsOfAPage);
+    for (const DeliveredEvent& row : page) {
+      lastNumber_ = row.number;
+      const bool visited = row.event.id != 0 && row.event.id <= lastId_;
+      if (wanted == SpoolRows::delivered || !visited)
+        rows.push_back({row.event, SpoolRow::Delivery{row.at, row.destination}});
+    }
+    if (!page.empty()) return rows;
+    if (wanted == SpoolRows::delivered || !failure_.ok()) return {};
   }
-  if (failure_.ok()) failure_ = database_.status();
+  SqliteStatement select = database_.prepare(kSelectEvents);
+  if (select.prepared()) {
+    for (SpooledEvent& event : readEvents(select, lastId_, kRowsOfAPage, kBytesOfAPage)) {
+      lastId_ = event.id;
+      rows.push_back({std::move(event), {}});
+    }
+  }
+  failure_ = database_.status();
+  return rows.empty() ? std::nullopt : std::optional(std::move(rows));
+}
+
+bool SpoolReader::readNew(SpoolRows wanted, const std::function<void(const SpoolRow&)>& visit) {
+  for (;;) {
+    failure_ = database_.execute("BEGIN");
+    const auto page = failure_.ok() ? nextPage(wanted) : std::nullopt;
+    database_.execute("COMMIT");
+    // The visitor is no client of this database, and the transaction is at its end.
+    for (const SpoolRow& row : page.value_or(std::vector<SpoolRow>{})) visit(row);
+    if (!failure_.ok()) break;
+    if (!page) return true;
+  }
   reason_ = path_ + ": " + failure_.reason;
   return false;
 }
 
-std::optional<SpooledEvent> SpoolReader::row(int64_t id) {
+std::optional<SpoolRow> SpoolReader::row(int64_t id) {
   SqliteStatement select = database_.prepare(kSelectEvents);
   std::vector<SpooledEvent> page;
   if (select.prepared()) page = readEvents(select, id - 1, 1, kBytesOfAPage);
   failure_ = database_.status();
+  if (!page.empty() && page.front().id == id) return SpoolRow{std::move(page.front()), {}};
+  if (failure_.ok()) {
+    auto delivered = deliveredRows(
+        "SELECT number, id, time, name, payload, delivered, destination FROM forwarder_delivered"
+        " WHERE id = ?1 ORDER BY number DESC LIMIT ?2",
+        id, 1);
+    if (!delivered.empty()) {
+      DeliveredEvent& found = delivered.front();
+      return SpoolRow{std::move(found.event),
+                      SpoolRow::Delivery{found.at, std::move(found.destination)}};
+    }
+  }
   reason_ = path_ + ": " + failure_.reason;
-  if (page.empty() || page.front().id != id) return {};
-  return std::move(page.front());
+  return {};
 }
 
 std::optional<std::pair<int64_t, int64_t>> SpoolReader::ids() {
-  const auto first = database_.integer("SELECT id FROM events ORDER BY id LIMIT 1");
-  const auto last = database_.integer("SELECT id FROM events ORDER BY id DESC LIMIT 1");
-  if (!first || !last) return {};
-  return std::pair(*first, *last);
+  std::optional<std::pair<int64_t, int64_t>> ids;
+  for (const char* table : {"events", "forwarder_delivered"}) {
+    const std::string rows = std::string(" FROM ") + table + " WHERE id IS NOT NULL";
+    const auto first = database_.integer("SELECT min(id)" + rows + " HAVING count(*) > 0");
+    const auto last = database_.integer("SELECT max(id)" + rows);
+    if (!first || !last) continue;
+    ids = ids ? std::pair(std::min(ids->first, *first), std::max(ids->second, *last))
+              : std::pair(*first, *last);
+  }
+  return ids;
+}
+
+std::vector<Delivered> SpoolReader::deliveries() {
+  SqliteStatement select = database_.prepare(
+      "SELECT destination, count(*), max(delivered) FROM forwarder_delivered GROUP BY destination"
+      " ORDER BY max(delivered) DESC LIMIT 8");
+  std::vector<Delivered> all;
+  while (select.prepared() && select.step() == SqliteStatement::Step::row)
+    all.push_back({std::string(select.text(0)), select.integer(1), select.integer(2)});
+  return all;
 }
 
 std::optional<SpoolContents> SpoolReader::contents() {
@@ -155,6 +217,7 @@ std::optional<SpoolContents> SpoolReader::contents() {
   const auto used = static_cast<uint64_t>(pages * kSpoolPageBytes);
   contents.bytesOfWaiting = used - std::min(used, delivered.bytes());
   contents.delivered = database_.integer("SELECT count(*) FROM forwarder_delivered").value_or(0);
+  contents.setAside = database_.integer("SELECT count(*) FROM forwarder_set_aside").value_or(0);
   if (const auto limit = database_.integer("SELECT value FROM meta WHERE key='limit_bytes'"))
     contents.limit = static_cast<uint64_t>(*limit);
   return contents;

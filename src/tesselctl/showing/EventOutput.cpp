@@ -89,28 +89,40 @@ std::string laidOut(std::string_view json) {
   return out;
 }
 
-Date dateOf(const SpooledEvent& row) { return Date{std::chrono::microseconds{row.time}}; }
+Date dateOf(int64_t microseconds) { return Date{std::chrono::microseconds{microseconds}}; }
+
+// A record that the forwarder itself has made has no id.
+std::string idText(const SpooledEvent& event) {
+  return event.id == 0 ? "" : std::to_string(event.id);
+}
 
 // The fields of a row for other programs. The payload is the last and the only one of any length.
-std::string rowFields(const SpooledEvent& row, const Terminal& terminal) {
-  return fieldsLine({std::to_string(row.id), terminal.paint(Colour::faint, stampText(dateOf(row))),
-                     terminalText(row.name), glance(parsed(row.payload), row.payload)});
+std::string rowFields(const SpoolRow& row, const Terminal& terminal) {
+  const SpooledEvent& event = row.event;
+  return fieldsLine({idText(event), terminal.paint(Colour::faint, stampText(dateOf(event.time))),
+                     terminalText(event.name),
+                     row.delivery ? stampText(dateOf(row.delivery->at)) : "",
+                     row.delivery ? terminalText(row.delivery->destination) : "",
+                     glance(parsed(event.payload), event.payload)});
 }
 
 constexpr size_t kIdWidth = 6;
 constexpr size_t kEventWidth = 24;
 
-std::string humanLine(const SpooledEvent& row, const Terminal& terminal) {
-  std::string name = shortened(shownName(row.name), kEventWidth);
+std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
+  const SpooledEvent& event = row.event;
+  std::string name = shortened(shownName(event.name), kEventWidth);
   name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
-  const std::string time = dateText(dateOf(row)).substr(5);
-  std::string id = std::to_string(row.id);
+  const std::string time = dateText(dateOf(event.time)).substr(5);
+  std::string id = idText(event);
   id.insert(0, kIdWidth - std::min(kIdWidth, id.size()), ' ');
+  const std::string state = row.delivery ? "sent " : "waits";
   // The payload gets the rest of the line, and one column at least on a narrow terminal.
-  const size_t used = id.size() + 2 + time.size() + 2 + kEventWidth + 2;
-  const std::string payload = cutOff(glance(parsed(row.payload), row.payload),
+  const size_t used = id.size() + 2 + time.size() + 2 + state.size() + 2 + kEventWidth + 2;
+  const std::string payload = cutOff(glance(parsed(event.payload), event.payload),
                                      terminal.width - std::min(used, terminal.width - 1));
-  return id + "  " + terminal.paint(Colour::faint, time) + "  " + name + "  " + payload + "\n";
+  return id + "  " + terminal.paint(Colour::faint, time) + "  " + state + "  " + name + "  " +
+         payload + "\n";
 }
 
 }  // namespace
@@ -120,33 +132,64 @@ EventPath pathOf(const SpooledEvent& row) {
   return {member(payload, "Subsystem"), member(payload, "Category")};
 }
 
-std::string eventJson(const SpooledEvent& row) {
+std::string eventJson(const SpoolRow& row) {
+  const SpooledEvent& event = row.event;
   return objectLine([&](JsonWriter& json) {
-    json.member("id", row.id).member("time", row.time).member("name", row.name);
+    if (event.id != 0) json.member("id", event.id);
+    json.member("time", event.time).member("name", event.name);
+    json.member("state", row.delivery ? "sent" : "waiting");
+    if (row.delivery) {
+      json.member("delivered", row.delivery->at);
+      json.member("destination", row.delivery->destination);
+    }
     // Any writer of the spool may have made this row. A payload that is no JSON would break the
     // line around it, so it goes out as a text under another key. A script can tell the two by the
     // key.
-    if (Json::accept(row.payload))
-      json.rawMember("payload", replaceInvalidUtf8(row.payload));
+    if (Json::accept(event.payload))
+      json.rawMember("payload", replaceInvalidUtf8(event.payload));
     else
-      json.member("payload_text", row.payload);
+      json.member("payload_text", event.payload);
   });
 }
 
-std::string wholeEvent(const SpooledEvent& row, const Terminal& terminal) {
+std::string wholeEvent(const SpoolRow& row, const Terminal& terminal) {
+  const SpooledEvent& event = row.event;
   const auto line = [&](std::string_view label, const std::string& text) {
     return terminal.paint(Colour::faint, label) + terminalText(text) + "\n";
   };
-  std::string out = line("Id       ", std::to_string(row.id)) +
-                    line("Time     ", stampText(dateOf(row))) + line("Name     ", row.name);
-  if (!Json::accept(row.payload)) return out + line("No JSON  ", row.payload);
+  std::string out = line("Id       ", idText(event)) +
+                    line("Time     ", stampText(dateOf(event.time))) +
+                    line("Name     ", event.name);
+  if (row.delivery) {
+    out +=
+        line("Sent     ", stampText(dateOf(row.delivery->at)) + " to " + row.delivery->destination);
+  }
+  if (!Json::accept(event.payload)) return out + line("No JSON  ", event.payload);
   std::string escaped;
-  JsonWriter(escaped, {.forTerminal = true}).raw(replaceInvalidUtf8(row.payload));
+  JsonWriter(escaped, {.forTerminal = true}).raw(replaceInvalidUtf8(event.payload));
   return out + laidOut(escaped) + "\n";
 }
 
-std::string eventLine(const SpooledEvent& row, const Terminal& terminal) {
+std::string eventLine(const SpoolRow& row, const Terminal& terminal) {
   return terminal.interactive ? humanLine(row, terminal) : rowFields(row, terminal);
+}
+
+std::string eventTotals(const SpoolContents& contents, const std::vector<Delivered>& deliveries) {
+  const auto rows = [](int64_t count) {
+    return counted(static_cast<uint64_t>(count), "row", "rows");
+  };
+  std::string out = rows(contents.rows) + (contents.rows == 1 ? " waits" : " wait") + ", " +
+                    rows(contents.delivered) + " sent and still here\n";
+  for (const Delivered& one : deliveries) {
+    out += rows(one.rows) + " to " + terminalText(one.destination) + ", the last at " +
+           dateText(dateOf(one.last)) + "\n";
+  }
+  if (contents.setAside != 0) {
+    out += rows(contents.setAside) +
+           " refused by the collector and set aside; 'statora_forwarder --requeue' lets them wait"
+           " again\n";
+  }
+  return out;
 }
 
 }  // namespace tessel::ctl

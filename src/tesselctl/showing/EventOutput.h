@@ -7,7 +7,7 @@
 
 #include <string>
 
-#include "statora/ForwarderState.h"
+#include "tesselctl/reading/SpoolReader.h"
 #include "tesselctl/showing/Terminal.h"
 
 namespace tessel::ctl {
@@ -20,10 +20,13 @@ struct EventPath {
 EventPath pathOf(const SpooledEvent& row);
 
 // One JSON object on a line.
-std::string eventJson(const SpooledEvent& row);
+std::string eventJson(const SpoolRow& row);
 // One line: as wide as the terminal, or fields with tabs between.
-std::string eventLine(const SpooledEvent& row, const Terminal& terminal);
+std::string eventLine(const SpoolRow& row, const Terminal& terminal);
 // All of the row, its payload laid out on many lines.
-std::string wholeEvent(const SpooledEvent& row, const Terminal& terminal);
+std::string wholeEvent(const SpoolRow& row, const Terminal& terminal);
+
+// Lines that say how many rows wait, how many went where, and what was refused.
+std::string eventTotals(const SpoolContents& contents, const std::vector<Delivered>& deliveries);
 
 }  // namespace tessel::ctl
