@@ -1,7 +1,7 @@
 // Drawing the charts.
 //
-// We draw on the server's side of the page, so charts need no script: the page is whole in a
-// browser that runs none. The price: a chart cannot be zoomed.
+// The page holds finished drawings, so its charts need no script: the page is whole in a browser
+// that runs none. The price: a chart cannot be zoomed.
 //
 // Two colours that touch must differ by more than their hue. Six colours cannot all contrast with
 // each other, and any two verdicts may be neighbours where those between them are absent. So parts

@@ -229,7 +229,7 @@ Html missSection(const Tally& tally, RecordedValues values, Names& names) {
   // Without a miss the section is left out: its heading alone would look like a fault.
   if (misses.empty() && tally.missesNotListed() == 0) return html;
   html << "<section>\n<h2>Values that are not known ones</h2>\n<p class=\"soft\">Text values for "
-          "which the whitelist held trace points back. The service does not send them.</p>\n";
+          "which the whitelist held trace points back. These trace points are not reported.</p>\n";
   if (values == RecordedValues::shown) {
     const auto groups = groupedMisses(misses, [](const Tally::Miss& miss) { return miss.value; });
     html << inTwoParts(

@@ -220,9 +220,9 @@ Html runSection(const ReportFacts& facts, Names& names) {
 Html namesNote(const Names& names) {
   Html html;
   if (names.withoutTitle() == 0) return html;
-  return html << "<p class=\"soft\">" << names.withoutTitle()
-              << " names are shortened for good, to keep this page small. <code>tesselctl explain "
-                 "--summary --json</code> has the whole of them.</p>\n";
+  return html << "<p class=\"soft\">To keep this page small, " << names.withoutTitle()
+              << " long names are shown only in part. <code>tesselctl explain --summary "
+                 "--json</code> has the whole of them.</p>\n";
 }
 
 }  // namespace
@@ -254,8 +254,8 @@ std::string htmlReport(const Tally& tally, const ExtractionReport& report,
   }
   html << runSection(facts, names) << readingSection(report, facts, names)
        << LossSection(report.store.reading, "What was lost", "", facts, names).html()
-       << namesNote(names) << "</main>\n<footer>Made on " << dateText(facts.made)
-       << " by tesselctl, on this machine, for this machine: nothing of it was sent.";
+       << namesNote(names) << "</main>\n<footer>tesselctl made this page on "
+       << dateText(facts.made) << " and sent it nowhere.";
   if (facts.withoutValues)
     html << " Recorded values, users, programs, paths and the machine's name are left out.";
   html << "</footer>\n<script>" << kReportScript << "</script>\n</body>\n</html>\n";
