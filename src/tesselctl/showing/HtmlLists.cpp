@@ -16,7 +16,7 @@ namespace tessel::ctl {
 
 namespace {
 
-// Entries that are in sight at once: as many as a screen has. One or two more are shown as well,
+// Entries that are in sight at once: as many as a screen has. A few more are shown as well,
 // because a disclosure for them would take their place.
 constexpr size_t kInSight = 20;
 constexpr size_t kInSightAlone = 25;

@@ -152,34 +152,35 @@ class LossSection {
     html << "<section>\n<h2>" << title_ << "</h2>\n";
     for (const std::string& sentence : {part, unread})
       if (!sentence.empty()) html << "<p>" << sentence << ".</p>\n";
-    return html << table(Whose::nobodys) << table(Whose::writers) << "</section>\n";
+    return html << table("losses", "Losses by reason", "Where",
+                         [](LossCode code) { return !isOfWriter(code); })
+                << table("lost_at_source",
+                         "Trace points that programs could not hand to the journal",
+                         "User and program",
+                         [](LossCode code) { return isOfWriter(code) && !isOverShare(code); })
+                << table("over_share",
+                         "Writers who had more than their share; only they lost by it",
+                         "User and program", isOverShare)
+                << "</section>\n";
   }
 
  private:
-  enum class Whose { nobodys, writers };
-
-  // A writer over his share loses what is his and nobody else's. That is no fault of the machine,
-  // so it has a table of its own.
-  Html table(Whose whose) {
+  // What belongs to a writer is no fault of the machine, so it stands in tables of its own.
+  Html table(std::string_view id, std::string_view caption, std::string_view place,
+             bool (*belongs)(LossCode)) {
     Html rows;
     for (const Loss& loss : reading_.losses.all()) {
-      if (isOverShare(loss.code) != (whose == Whose::writers)) continue;
+      if (!belongs(loss.code)) continue;
       rows << "<tr><th scope=\"row\"><code>" << lossName(loss.code) << "</code> " << loss.words
            << "</th><td class=\"n\">" << loss.count << "</td><td>";
       if (!facts_.withoutValues && !loss.where().empty()) rows << names_(loss.where(), kWhole);
       rows << "</td></tr>\n";
     }
     if (rows.text().empty()) return rows;
-    Html table;
-    if (whose == Whose::nobodys) {
-      table << tableHead(std::string(id_) + "losses", Html() << "Losses by reason",
-                         {{"Why"}, {"Lost", Column::Kind::number}, {"Where"}});
-    } else {
-      table << tableHead(std::string(id_) + "over_share",
-                         Html() << "Writers who had more than their share; only they lost by it",
-                         {{"What"}, {"Lost", Column::Kind::number}, {"User and program"}});
-    }
-    return table << rows << tableEnd();
+    Html html;
+    return html << tableHead(std::string(id_).append(id), Html() << caption,
+                             {{"What"}, {"Lost", Column::Kind::number}, {place}})
+                << rows << tableEnd();
   }
 
   const StoreReading& reading_;
