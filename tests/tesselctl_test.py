@@ -42,7 +42,7 @@ class Statuses(CtlTest):
         self.assertEqual((result.status, "TESSEL_DEFER_RETRY" in result.errors), (2, True), result.errors)
 
     def test_help_is_narrow_and_has_an_example(self):
-        for command in ("explain", "compare", "events", "status", "defer", "tasking", "report"):
+        for command in ("explain", "compare", "events", "rules", "status", "defer", "tasking", "report"):
             result = self.machine.ctl(command, "--help")
             self.assertEqual(result.status, 0)
             self.assertIn("Example", result.out)

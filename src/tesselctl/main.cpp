@@ -65,6 +65,7 @@ int run(std::vector<std::string> arguments) {
   addExplainCommand(app, invocation);
   addCompareCommand(app, invocation);
   addEventsCommand(app, invocation);
+  addRulesCommand(app, invocation);
   addStatusCommand(app, invocation);
   addDeferCommand(app, invocation);
   addTaskingCommand(app, invocation);

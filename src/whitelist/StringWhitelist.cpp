@@ -46,8 +46,9 @@ bool shouldUseStringWhitelist(BuildVariant& variant) {
 }
 
 bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef name) {
-  return sameString(subsystem, "com.vantor.PerformanceAnalysis") &&
-         sameString(category, "PerfLogging") && sameString(name, "PerfLoggingOperation");
+  return sameString(subsystem, kPerfLoggingOperation[0]) &&
+         sameString(category, kPerfLoggingOperation[1]) &&
+         sameString(name, kPerfLoggingOperation[2]);
 }
 
 bool perfLoggingOperationStringsPass(StringRef component, StringRef action) {

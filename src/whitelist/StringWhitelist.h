@@ -43,6 +43,8 @@ bool shouldUseStringWhitelist(BuildVariant& variant);
 // Whether a trace point is a performance-logging operation. A platform whose profile has
 // hasPerfLoggingRule treats these differently: the first string must be a known component and the
 // second a known action.
+inline constexpr std::string_view kPerfLoggingOperation[] = {"com.vantor.PerformanceAnalysis",
+                                                             "PerfLogging", "PerfLoggingOperation"};
 bool isPerfLoggingOperation(StringRef subsystem, StringRef category, StringRef name);
 // Whether `component` is a known component and `action` a known action. An absent string is
 // neither.

@@ -1319,4 +1319,24 @@ StringList sizeValues() { return kSizeValues; }
 StringList mailAccountKindValues() { return kMailAccountKindValues; }
 StringList generationSourceValues() { return kGenerationSourceValues; }
 
+std::span<const StringListRow> stringLists() {
+  static constexpr StringListRow kRows[] = {
+      {"common", "values that several platforms know", commonWhitelistValues},
+      {"period-views", "periods that a view shows", periodViewValues},
+      {"sizes", "sizes of a view or a widget", sizeValues},
+      {"generation-sources", "where a generated thing came from", generationSourceValues},
+      {"mail-account-kinds", "providers and protocols of mail accounts", mailAccountKindValues},
+      {"launch-sources", "where a launch or a transition starts", launchSourceValues},
+      {"camera", "actions and mode codes of the camera", cameraValues},
+      {"share-activities", "activities of the share sheet", shareActivityTypes},
+      {"file-system-scans", "file-system formats and outcomes of scans", fileSystemScanValues},
+      {"components", "components of the desktop's user interface", perfLoggingComponentNames},
+      {"actions", "operations and animation phases of the desktop", perfLoggingActionNames},
+      {"extension-bundles", "bundle identifiers of application extensions",
+       extensionBundleIdentifiers},
+      {"desktop-bundles", "bundle identifiers of the desktop's programs", desktopBundleIdentifiers},
+  };
+  return kRows;
+}
+
 }  // namespace tessel

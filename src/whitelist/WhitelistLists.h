@@ -39,4 +39,13 @@ StringList sizeValues();
 StringList mailAccountKindValues();
 StringList generationSourceValues();
 
+// A list as people see it.
+struct StringListRow {
+  std::string_view name;   // as a command line shows it; stays, since scripts read it
+  std::string_view words;  // what its values are
+  StringListSource list;
+};
+// All lists. Each list above has one row.
+std::span<const StringListRow> stringLists();
+
 }  // namespace tessel

@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <map>
@@ -51,6 +52,10 @@ TEST(WhitelistTest, EachPlatformKnowsItsLists) {
   for (const auto& row : kLists) {
     const std::set<std::string_view> distinct(row.list.begin(), row.list.end());
     EXPECT_EQ(row.list.size(), row.entries) << row.name;
+    EXPECT_EQ(std::ranges::count(stringLists(), row.list.data(),
+                                 [](const StringListRow& shown) { return shown.list().data(); }),
+              1)
+        << row.name;
     EXPECT_EQ(distinct.size(), row.distinct) << row.name;
     for (const Platform platform : row.platforms) sizes[platform] += row.distinct;
     for (const auto text : distinct) {

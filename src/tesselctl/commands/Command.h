@@ -145,6 +145,7 @@ void addRecordCommand(CLI::App& app, Invocation& invocation);
 void addExplainCommand(CLI::App& app, Invocation& invocation);
 void addCompareCommand(CLI::App& app, Invocation& invocation);
 void addEventsCommand(CLI::App& app, Invocation& invocation);
+void addRulesCommand(CLI::App& app, Invocation& invocation);
 void addStatusCommand(CLI::App& app, Invocation& invocation);
 void addDeferCommand(CLI::App& app, Invocation& invocation);
 void addTaskingCommand(CLI::App& app, Invocation& invocation);

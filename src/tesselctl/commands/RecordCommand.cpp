@@ -187,20 +187,6 @@ int recordPoint(const RecordOptions& options, const std::string& kind) {
   return failure ? fail(failure->status, failure->message) : kDone;
 }
 
-template <size_t N>
-void addSlotOptions(CLI::App& app, const std::string& name,
-                    std::array<std::optional<Labelled>, N>& pairs, const std::string& what) {
-  for (size_t slot = 0; slot < N; ++slot) {
-    const auto take = [&pair = pairs[slot]](const std::string& text) {
-      pair = labelledFrom(text);
-      if (!pair) throw CLI::ValidationError("'" + text + "' is not LABEL=VALUE");
-    };
-    const std::string number = std::to_string(slot + 1);
-    app.add_option_function<std::string>(name + number, take, what + " " + number)
-        ->type_name("LABEL=VALUE");
-  }
-}
-
 void addPointOptions(CLI::App& app, RecordedPoint& point) {
   app.add_flag("--telemetry", point.telemetry,
                "Mark it for telemetry; what is not marked is never reported");

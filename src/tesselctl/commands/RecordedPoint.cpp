@@ -6,6 +6,8 @@
 #include <algorithm>
 #include <span>
 
+#include <CLI/CLI.hpp>
+
 #include "journal/EntryStream.h"
 #include "trace/TracePointTable.h"
 
@@ -137,6 +139,19 @@ std::optional<Labelled> labelledFrom(const std::string& text) {
   const size_t equals = text.find('=');
   if (equals == std::string::npos) return std::nullopt;
   return Labelled{text.substr(0, equals), text.substr(equals + 1)};
+}
+
+void addSlotOptions(CLI::App& app, const std::string& name,
+                    std::span<std::optional<Labelled>> slots, const std::string& what) {
+  for (size_t slot = 0; slot < slots.size(); ++slot) {
+    const auto take = [&labelled = slots[slot]](const std::string& text) {
+      labelled = labelledFrom(text);
+      if (!labelled) throw CLI::ValidationError("'" + text + "' is not LABEL=VALUE");
+    };
+    const std::string number = std::to_string(slot + 1);
+    app.add_option_function<std::string>(name + number, take, what + " " + number)
+        ->type_name("LABEL=VALUE");
+  }
 }
 
 std::variant<std::vector<RecordedField>, std::string> fieldsOf(const RecordedPoint& point) {

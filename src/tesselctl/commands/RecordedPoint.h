@@ -7,6 +7,7 @@
 
 #include <array>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <variant>
@@ -14,6 +15,10 @@
 
 #include "journal/EntryRecording.h"
 #include "objects/TesselObject.h"
+
+namespace CLI {
+class App;
+}
 
 namespace tessel::ctl {
 
@@ -27,6 +32,11 @@ struct Labelled {
 };
 // Splits LABEL=VALUE at the first '='; absent without one.
 std::optional<Labelled> labelledFrom(const std::string& text);
+
+// Adds an option for each slot, such as --string1 and --string2, that takes LABEL=VALUE. `slots`
+// must outlive `app`.
+void addSlotOptions(CLI::App& app, const std::string& name,
+                    std::span<std::optional<Labelled>> slots, const std::string& what);
 
 struct RecordedPoint {
   std::string kind = "event";  // event, begin or end
