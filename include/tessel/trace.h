@@ -115,7 +115,9 @@ typedef struct tessel_point {
   size_t attribute_count;
   const char* interval_id; /* pairs begin and end; absent: an id of the token's own */
   bool system_scope;       /* begin and end may come from different processes */
-  bool telemetry;          /* may be reported; without it the trace point stays on the machine */
+  /* May be reported. Without it the trace point stays on the machine, but its subsystem and category
+   * are counted, and the count may be sent. */
+  bool telemetry;
   bool no_wait;            /* rather lost than waited for */
 } tessel_point;
 

@@ -279,7 +279,7 @@ class Interval(_Point):
 def event(subsystem: str, category: str, name: Optional[str] = None, *, string1: Optional[String] = None,
           string2: Optional[String] = None, number1: Optional[Number] = None, number2: Optional[Number] = None,
           attributes: Optional[Mapping[str, str]] = None, telemetry: bool = False, no_wait: bool = False) -> int:
-    """Records a single event. Without `telemetry` it stays on the machine."""
+    """Records a single event. Without `telemetry` it stays on the machine and is only counted."""
     if not RECORDER.enabled():
         return 0
     point = _Point(subsystem, category, name, string1=string1, string2=string2, number1=number1, number2=number2,
