@@ -58,7 +58,7 @@ bool EntryChain::loadPiece() {
   arrayIndex_ += count;
   // The daemon lists an entry when it is finished. Entries beyond the header's count were added
   // since, and the window may hold what stood in their place before.
-  if (file_.header().beingWritten() && listed_ + arrayIndex_ > file_.header().entryCount)
+  if (listed_ + arrayIndex_ > file_.header().entryCount && file_.beingWritten())
     file_.file().forget();
   return true;
 }
@@ -182,7 +182,7 @@ bool EntryWalk::next() {
 bool EntryWalk::atEnd() const {
   if (listed_ != kEnded) return false;
   const bool behindLast = position_ > file_.header().lastObject;
-  if (file_.header().beingWritten()) return behindLast || !chain_.endedEarly();
+  if (file_.beingWritten()) return behindLast || !chain_.endedEarly();
   return behindLast && !chain_.endedEarly() && found_ >= file_.header().entryCount;
 }
 
@@ -262,8 +262,8 @@ void EntryWalk::advanceList() {
     if (chain_.endedEarly()) tellOfList(chain_.problemAt());
   } else if (listed_ < position_ || !file_.mayHoldObject(listed_, kEntryItemsAt)) [[unlikely]] {
     // The file may grow while we read. What lies behind its old end was added since.
-    if (file_.header().beingWritten() && found_ >= file_.header().entryCount &&
-        listed_ >= file_.objectsEnd()) {
+    if (found_ >= file_.header().entryCount && listed_ >= file_.objectsEnd() &&
+        file_.beingWritten()) {
       listed_ = kEnded;
       return;
     }
@@ -316,7 +316,7 @@ bool EntryWalk::makesSense(uint64_t offset) {
   const uint64_t next = alignUp(offset + object.size);
   // While a file is being written, an object behind the last one may be unfinished.
   const uint64_t last =
-      file_.header().beingWritten() ? file_.header().lastObject : file_.objectsEnd();
+      file_.header().wasBeingWritten() ? file_.header().lastObject : file_.objectsEnd();
   return next >= onlyZerosFrom() || next > last || objectBeginsAt(next);
 }
 

@@ -103,9 +103,10 @@ void JournalEntryStream::finish() {
         file_.file().size());
   context_.report.addProblem("entries missing", file_.objectsEnd(), missing);
   // The last entry has no later neighbour. The header of a closed file has its times instead.
-  if (!file_.header().beingWritten() && walk_.entriesFound() != 0 &&
+  if (walk_.entriesFound() != 0 &&
       (walk_.header().realtime != file_.header().tailRealtime ||
-       walk_.header().monotonic != file_.header().tailMonotonic))
+       walk_.header().monotonic != file_.header().tailMonotonic) &&
+      !file_.beingWritten())
     context_.report.addProblem("last entry with other times than the header", walk_.offset());
 }
 

@@ -80,6 +80,15 @@ JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header
       itemShift_(std::countr_zero(header.compact() ? kCompactEntryItemSize : kEntryItemSize)),
       dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
 
+bool JournalFile::beingWritten() {
+  if (writtenSince_ || header_.wasBeingWritten()) return true;
+  std::array<uint8_t, kMinHeaderSize> bytes;
+  if (file_.read(0, bytes) != bytes.size()) return false;
+  writtenSince_ = bytes[kStateAt] == kOnline ||
+                  load<uint64_t>(bytes.data() + kTailRealtimeAt) != header_.tailRealtime;
+  return writtenSince_;
+}
+
 uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
   if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
   // Computed first: at() may find the file cut before `offset`, and objectsEnd() then moves.

@@ -49,7 +49,7 @@ struct JournalHeader {
     return incompatibleFlags & ~journal_format::kKnownIncompatibleFlags;
   }
   bool keyedHash() const { return (incompatibleFlags & journal_format::kKeyedHash) != 0; }
-  bool beingWritten() const { return state == journal_format::kOnline; }
+  bool wasBeingWritten() const { return state == journal_format::kOnline; }
 };
 
 // Parses the beginning of a file of `fileSize` bytes. If the file is no journal, returns the
@@ -91,6 +91,10 @@ class JournalFile {
 
   const JournalHeader& header() const { return header_; }
   WindowedFile& file() { return file_; }
+  // Whether somebody writes the file while we read it, or has written to it since it was opened.
+  // The daemon closes a user's journal when it is quiet, and opens the same file again for the next
+  // entry.
+  bool beingWritten();
 
   // The end of the objects: that of the file, because a wrong size in the header could hide some.
   // It becomes smaller if a read finds the file shorter.
@@ -155,6 +159,7 @@ class JournalFile {
                                              journal_format::kTagSize};
 
   const JournalHeader header_;
+  bool writtenSince_ = false;
   WindowedFile file_;
   const int itemShift_;  // the size of an item is a power of two; division is slow
   const size_t dataHeaderSize_;

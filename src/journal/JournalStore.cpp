@@ -212,7 +212,7 @@ void JournalStore::State::openForeign(StoreFile& file, uint64_t entryCount, uint
 // earlier than the first, we see that the clock was set, and read the file. Otherwise such entries
 // are lost; to find them we would have to look at every entry.
 bool JournalStore::State::outsideRange(const JournalHeader& header) const {
-  if (header.beingWritten() || header.headRealtime == 0 ||
+  if (header.wasBeingWritten() || header.headRealtime == 0 ||
       header.tailRealtime < header.headRealtime || header.tailRealtime >= journal_format::kMaxTime)
     return false;
   return header.tailRealtime < range.start || header.headRealtime >= range.end;
