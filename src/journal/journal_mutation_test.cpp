@@ -1,20 +1,17 @@
 // One wrong word in a journal: no trace point is missing or changed without a word.
 //
-// Every word of the header and of every object is bent in turn: to zero, to the greatest number, by
-// one bit, by one place, and to words that mean something, such as the offset of another object of
-// the same kind. TESSEL_DAMAGE_ROUNDS=10000 tries so many bends of each kind of file.
+// Two readers are compared with the truth: one that looks at trace points alone, and one that looks
+// at every entry. TESSEL_DAMAGE_ROUNDS=10000 tries so many bends of each kind of file.
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-#include <cstdlib>
 #include <map>
 #include <random>
 #include <tuple>
 
 #include "journal/JournalFormat.h"
 #include "journal/JournalStore.h"
-#include "journal/testing/JournalDamage.h"
+#include "journal/testing/JournalBender.h"
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
 #include "os/testing/TemporaryDirectory.h"
@@ -25,14 +22,9 @@ namespace {
 using namespace journal_format;
 using testing::JournalLayout;
 using testing::JournalWriter;
-using testing::put;
 
 // The first and the last entry are no trace points: nothing tells whether their boot is right.
 constexpr size_t kJournalEntries = 121;
-
-uint64_t wordAt(const std::string& file, uint64_t at) {
-  return load<uint64_t>(reinterpret_cast<const uint8_t*>(file.data()) + at);
-}
 
 // Every third entry is a trace point, every fifteenth tells of loss.
 JournalWriter journalWith(JournalLayout layout) {
@@ -92,79 +84,6 @@ Points pointsIn(const std::string& path, std::vector<std::string_view> marks) {
   return points;
 }
 
-struct Object {
-  uint8_t type;
-  uint64_t offset;
-  uint64_t size;
-};
-
-std::vector<Object> objectsOf(const std::string& file) {
-  std::vector<Object> objects;
-  for (uint64_t at = wordAt(file, kHeaderSizeAt); at + 16 <= file.size();) {
-    objects.push_back({static_cast<uint8_t>(file[at]), at, wordAt(file, at + kObjectSizeAt)});
-    at = alignUp(at + objects.back().size);
-  }
-  return objects;
-}
-
-class Bender {
- public:
-  Bender(const std::string& file, bool compact)
-      : file_(file), objects_(objectsOf(file)), compact_(compact) {}
-
-  // A copy of the file with one bent word, and which word that is.
-  std::pair<std::string, std::string> bent(std::mt19937_64& random) const {
-    std::string file = file_;
-    uint64_t at = random() % (kMinHeaderSize / 8 - 1) * 8 + 8;
-    std::string name = "header";
-    uint8_t type = 0;
-    if (random() % 16 != 0) {
-      const Object& object = objects_[random() % objects_.size()];
-      type = object.type;
-      const uint64_t within = random() % alignUp(object.size) & ~uint64_t{7};
-      at = object.offset + within;
-      name = "type " + std::to_string(type) + " at " + std::to_string(object.offset) + " + " +
-             std::to_string(within);
-    }
-    const bool half = compact_ && (type == kEntry || type == kEntryArray) && random() % 2 == 0;
-    const uint64_t old = wordAt(file, at);
-    uint64_t value =
-        half ? (old & UINT32_MAX) | other(old >> 32, random) << 32 : other(old, random);
-    put(file, at, value);
-    return {file, name + ": " + std::to_string(old) + " to " + std::to_string(value)};
-  }
-
- private:
-  uint64_t other(uint64_t old, std::mt19937_64& random) const {
-    switch (random() % 6) {
-      case 0:
-        return old == 0 ? UINT64_MAX : 0;
-      case 1:
-        return old ^ uint64_t { 1 } << random() % (random() % 2 == 0 ? 16 : 64);
-      case 2:
-        return old + 8;
-      case 3:
-        return old + 1;
-      default:
-        return similar(old, random);
-    }
-  }
-  // The offset or the size of another object, of the same type if `old` is an object's.
-  uint64_t similar(uint64_t old, std::mt19937_64& random) const {
-    const auto known = std::ranges::find(objects_, old, &Object::offset);
-    for (int tries = 0; tries < 50; ++tries) {
-      const Object& object = objects_[random() % objects_.size()];
-      if (known == objects_.end()) return random() % 2 == 0 ? object.size : object.offset;
-      if (object.type == known->type && object.offset != old) return object.offset;
-    }
-    return old + 16;
-  }
-
-  const std::string file_;
-  const std::vector<Object> objects_;
-  const bool compact_;
-};
-
 using Parameters = std::tuple<bool, bool, uint8_t, uint8_t>;
 class JournalMutationTest : public ::testing::TestWithParam<Parameters> {};
 
@@ -180,8 +99,7 @@ TEST_P(JournalMutationTest, ChangesNothingWithoutAWord) {
                              .compression = compression,
                              .compressFrom = 24,
                              .state = state};
-  const char* wanted = std::getenv("TESSEL_DAMAGE_ROUNDS");
-  const uint64_t rounds = wanted != nullptr ? std::strtoull(wanted, nullptr, 10) : 150;
+  const uint64_t rounds = testing::damageRounds(150);
   const testing::TemporaryDirectory directory;
   const std::string good = journalWith(layout).bytes();
   const std::string path = directory.write("a.journal", good);
@@ -189,7 +107,7 @@ TEST_P(JournalMutationTest, ChangesNothingWithoutAWord) {
   ASSERT_EQ(truth.texts.size(), kJournalEntries / 3);
   ASSERT_EQ(truth.dropped, kJournalEntries / 15 + 1);
   ASSERT_FALSE(truth.told);
-  const Bender bender(good, compact);
+  const testing::JournalBender bender(good, compact);
   std::mt19937_64 random(1);
   for (uint64_t round = 0; round < rounds; ++round) {
     const auto [file, what] = bender.bent(random);
