@@ -2,6 +2,8 @@
 
 #include "journal/JournalStore.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <filesystem>
 #include <map>
@@ -34,6 +36,8 @@ constexpr Id128 kNoSequence{};
 void addFile(const FileReport& file, StoreReading& reading) {
   if (!file.skipped) {
     ++reading.filesRead;
+  } else if (file.removed) {
+    return;  // as if the store had been opened a moment later
   } else if (file.outsideRange) {
     ++reading.filesOutsideRange;
     if (reading.outsideRange.size() < StoreReading::kMaxNamed)
@@ -158,6 +162,10 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
   auto opened = readJournalHeader(file.fd.get());
   if (auto* error = std::get_if<PlatformError>(&opened)) {
     report.skipped = std::move(error->words);
+    // The daemon removes an empty journal when it rotates, and frees its blocks.
+    struct stat found {};
+    report.removed = ::fstat(file.fd.get(), &found) == 0 && found.st_nlink == 0;
+    if (report.removed) report.skipped = "removed before it was read";
     if (number == 0) firstFailure = error->code;
     return;
   }
