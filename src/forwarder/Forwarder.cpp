@@ -181,6 +181,7 @@ Forwarder::Sent Forwarder::send(Records part) {
     counters.bytesSent += answer.bytesSent;
     const Verdict verdict = verdictOn(answer);
     if (verdict == Verdict::accepted || verdict == Verdict::refused) return settle(part, answer);
+    noteFailure(answer);
     if (verdict == Verdict::hold) return fail(ForwarderOutcome::held, answerWords(answer));
     if (failures == options_.maxAttempts)
       return fail(ForwarderOutcome::unreachable, answerWords(answer));
@@ -193,11 +194,25 @@ bool Forwarder::waitToRetry(const CollectorAnswer& answer, uint32_t failures) {
   // The log tells this once per batch. The status shows the latest answer.
   if (failures == 1) kForwarderLog.error("The collector takes nothing for now: %@", words);
   world_.status.say("Waiting for the collector: " + words);
-  ++world_.state.counters().retries;
+  const auto wait = backoff_.wait(failures, world_.chance(), answer.retryAfter);
+  ForwarderCounters& counters = world_.state.counters();
+  ++counters.retries;
+  if (answer.retryAfter)
+    counters.orderedUntil =
+        counters.lastErrorAt + static_cast<uint64_t>(std::chrono::microseconds(wait).count());
   world_.state.storeCounters();
   // An outage may last for days, and delivered rows are past theirs meanwhile.
   world_.state.shortenDelivered(world_.clock.now());
-  return takeBreak(backoff_.wait(failures, world_.chance(), answer.retryAfter));
+  return takeBreak(wait);
+}
+
+// For `tesselctl status`: nobody else can tell a collector that is away from a forwarder that
+// hangs. Whoever calls this stores the counters.
+void Forwarder::noteFailure(const CollectorAnswer& answer) {
+  ForwarderCounters& counters = world_.state.counters();
+  counters.lastError = answerWords(answer);
+  counters.lastErrorAt = static_cast<uint64_t>(world_.clock.now().time_since_epoch().count());
+  counters.orderedUntil = 0;
 }
 
 Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
@@ -205,6 +220,7 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
     if (part.size() > 1) return Sent::refused;
     if (!setAside(part.front().event, answer.status, answerWords(answer))) return Sent::failed;
     if (++refusals_ < options_.refusalsInARow) return Sent::accepted;
+    noteFailure(answer);
     return fail(ForwarderOutcome::held, "record after record is refused: " + answerWords(answer));
   }
   refusals_ = 0;

@@ -130,6 +130,7 @@ class Forwarder {
   ForwarderOutcome deliverBatch(const Batch& batch);
   // After `failed`, `outcome_` and `reason_` say what has failed.
   Sent send(Records part);
+  void noteFailure(const CollectorAnswer& answer);
   bool waitToRetry(const CollectorAnswer& answer, uint32_t failures);
   Sent settle(Records part, const CollectorAnswer& answer);
   bool setAside(const SpooledEvent& event, int64_t status, const std::string& words);

@@ -79,7 +79,11 @@ constexpr Counter kCounters[] = {
     {"bytes_sent", &ForwarderCounters::bytesSent},
     {"position", &ForwarderCounters::position},
     {"last_success", &ForwarderCounters::lastSuccess},
+    {"last_error_at", &ForwarderCounters::lastErrorAt},
+    {"ordered_until", &ForwarderCounters::orderedUntil},
 };
+// Stands in the same table, because a column of SQLite takes a text as well as a number.
+constexpr std::string_view kLastError = "last_error";
 
 }  // namespace
 
@@ -93,6 +97,7 @@ std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database)
                      [&](const Counter& counter) { return select.text(0) == counter.name; });
     if (known != std::end(kCounters))
       counters.*known->value = static_cast<uint64_t>(select.integer(1));
+    if (select.text(0) == kLastError) counters.lastError = select.text(1);
   }
   return counters;
 }
@@ -204,6 +209,9 @@ uint64_t ForwarderState::waiting() {
 }
 
 bool ForwarderState::writeCounters() {
+  if (!counters_.lastError.empty() &&
+      !count_.bind(1, kLastError).bind(2, counters_.lastError).run())
+    return false;
   return std::all_of(std::begin(kCounters), std::end(kCounters), [this](const Counter& counter) {
     return count_.bind(1, std::string_view(counter.name))
         .bind(2, static_cast<int64_t>(counters_.*counter.value))

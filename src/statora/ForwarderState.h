@@ -2,7 +2,7 @@
 //
 // A row stays in `events` until a collector has taken it. The forwarder adds three tables:
 //
-//   forwarder            name and value of each counter
+//   forwarder            name and value of each counter, and the words of the last failure
 //   forwarder_delivered  the rows that a collector has taken lately, see SpoolRows.h
 //   forwarder_set_aside  the rows that cannot be delivered, each with the time of the refusal and
 //                        the collector's status and words (status 0: no collector was asked)
@@ -35,6 +35,11 @@ struct ForwarderCounters {
   uint64_t bytesSent = 0;    // of request bodies, as sent
   uint64_t position = 0;     // id of the last row that was delivered
   uint64_t lastSuccess = 0;  // microseconds since 1970; 0: never
+  // Why the collector took nothing when it was last asked in vain. A later success leaves it as it
+  // is. The words are one line that is fit for a terminal.
+  std::string lastError;
+  uint64_t lastErrorAt = 0;   // microseconds since 1970; 0: never
+  uint64_t orderedUntil = 0;  // until when the collector then asked us to wait; 0: it did not
 
   bool operator==(const ForwarderCounters&) const = default;
 };
