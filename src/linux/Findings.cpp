@@ -210,10 +210,9 @@ class RunFindings {
                                         ", reason " + escaped(reason));
     }
     addBalances(refused);
-    if (record_.rowsExpired != 0) {
-      add(FindingCode::rowsExpired,
-          "Rows of the spool expired: " + std::to_string(record_.rowsExpired) +
-              " stood there for longer than TESSEL_SPOOL_DAYS");
+    if (const uint64_t expired = record_.rowsExpired + record_.expiredSince; expired != 0) {
+      add(FindingCode::rowsExpired, "Rows of the spool expired: " + std::to_string(expired) +
+                                        " stood there for longer than TESSEL_SPOOL_DAYS");
     }
     if (!record_.setAside.empty())
       add(FindingCode::spoolSetAside, "A damaged spool was set aside: " + joined(record_.setAside));

@@ -1,4 +1,8 @@
-// The run record as JSON.
+// The record of the last run and the notes of the last runs as JSON.
+//
+// One file holds both, so that they cannot disagree: a run that dies between two files would have
+// an end in the one and not in the other. The price: the begin of a run rewrites the whole file.
+// The record stands in it as before there were notes, so older programs still read it.
 //
 // A program may read the file while a run replaces it, and the power may fail meanwhile. So the
 // file is replaced as a whole, and a reader finds either the old record or the new one.
@@ -9,6 +13,7 @@
 #include <iterator>
 #include <nlohmann/json.hpp>
 
+#include "linux/SystemFacts.h"
 #include "os/Files.h"
 #include "platform/Invariant.h"
 #include "platform/Json.h"
@@ -26,8 +31,14 @@ constexpr size_t kMaxFailureBytes = 1024;
 // text at most. So 51 losses with two such texts each and 85 with one take 120 KiB with their keys.
 constexpr size_t kMaxTextBytes = 256;
 
+// The year 9999. Later dates are damage, and could overflow whoever calculates with them.
+constexpr int64_t kLatestDate = 253'402'300'799'000'000;
+
 Date dateAt(const Json& json, const char* key) {
-  return Date{std::chrono::microseconds{json.at(key).get<int64_t>()}};
+  const auto microseconds = json.at(key).get<int64_t>();
+  if (microseconds < 0 || microseconds > kLatestDate)
+    throw Json::other_error::create(501, "no date", nullptr);
+  return Date{std::chrono::microseconds{microseconds}};
 }
 
 uint64_t countAt(const Json& json, const char* key) { return json.at(key).get<uint64_t>(); }
@@ -130,7 +141,96 @@ RunRecord recordFrom(const Json& json) {
     record.totals.expired = countAt(json.at("totals"), "expired");
     record.totals.failed = json.at("totals").at("failed").get<std::map<std::string, uint64_t>>();
   }
+  record.expiredSince = json.value("expired_since", uint64_t{0});
+  if (json.contains("interval"))
+    record.interval = std::chrono::seconds{json.at("interval").get<int64_t>()};
   return record;
+}
+
+void addRecord(JsonWriter& json, const RunRecord& record) {
+  json.member("start", record.start).member("end", record.end);
+  json.member("outcome", runOutcomeName(record.outcome));
+  json.member("failure", shortPlainText(record.failure, kMaxFailureBytes));
+  json.member("log_events", record.logEvents).member("inspected", record.inspected);
+  json.array("classified", record.classified, [&](uint64_t count) { json.value(count); });
+  json.member("unnamed", record.unnamed).member("unsendable", record.unsendable);
+  json.member("count_events", record.countEvents);
+  if (record.reading) json.object("reading", [&] { addReading(json, *record.reading); });
+  json.member("rows_stored", record.rowsStored).member("rows_expired", record.rowsExpired);
+  json.object("rows_failed", [&] {
+    for (const auto& [reason, count] : record.rowsFailed) json.member(reason, count);
+  });
+  json.array("set_aside", record.setAside, [&](const std::string& name) { json.value(name); });
+  json.member("marker", record.marker);
+  json.object("totals", [&] {
+    json.member("expired", record.totals.expired);
+    json.object("failed", [&] {
+      for (const auto& [reason, count] : record.totals.failed) json.member(reason, count);
+    });
+  });
+  json.member("expired_since", record.expiredSince);
+  if (record.interval) json.member("interval", int64_t{record.interval->count()});
+}
+
+void addNote(JsonWriter& json, const RunNote& note) {
+  json.member("start", note.start).member("end", note.end);
+  if (note.outcome) json.member("outcome", runOutcomeName(*note.outcome));
+  json.member("boot", note.boot).member("boot_began", note.bootBegan);
+  json.member("tasking_written", note.taskingWritten);
+}
+
+RunNote noteFrom(const Json& json) {
+  RunNote note;
+  note.start = dateAt(json, "start");
+  if (json.contains("end")) {
+    note.end = dateAt(json, "end");
+    note.outcome = required(outcomeNamed(json.at("outcome").get<std::string>()));
+  }
+  note.boot = json.at("boot").get<std::string>();
+  if (json.contains("boot_began")) note.bootBegan = dateAt(json, "boot_began");
+  if (json.contains("tasking_written")) note.taskingWritten = dateAt(json, "tasking_written");
+  return note;
+}
+
+RunNote noteOf(const RunRecord& record) {
+  return {record.start, record.end, record.outcome, {}, {}, {}};
+}
+
+RunHistory historyFrom(const Json& json) {
+  RunHistory history;
+  // Until the first run comes to its end there are notes alone.
+  if (json.contains("start") || !json.contains("runs")) history.last = recordFrom(json);
+  if (json.contains("runs")) {
+    for (const Json& note : json.at("runs")) history.runs.push_back(noteFrom(note));
+  } else {
+    // An older service kept no notes. Its record says as much of one run.
+    history.runs.push_back(noteOf(*history.last));
+  }
+  return history;
+}
+
+void boundNotes(RunHistory& history) {
+  if (history.runs.size() > RunHistory::kMaxRuns)
+    history.runs.erase(history.runs.begin(), history.runs.end() - RunHistory::kMaxRuns);
+}
+
+std::optional<PlatformError> writeHistory(RunHistory history, const std::string& stateDirectory) {
+  boundNotes(history);
+  std::string text;
+  JsonWriter json(text, {.indent = 1});
+  json.object([&] {
+    if (history.last) addRecord(json, *history.last);
+    json.array("runs", history.runs,
+               [&](const RunNote& note) { json.object([&] { addNote(json, note); }); });
+  });
+  return replaceFileDurably(runRecordPath(stateDirectory), text + "\n");
+}
+
+// A file that is not used is begun anew, because the next run has to leave something.
+RunHistory usableHistory(const std::string& stateDirectory) {
+  auto read = readRunHistory(stateDirectory);
+  auto* history = std::get_if<RunHistory>(&read);
+  return history != nullptr ? std::move(*history) : RunHistory{};
 }
 
 }  // namespace
@@ -139,47 +239,46 @@ std::string runRecordPath(const std::string& stateDirectory) {
   return stateDirectory + "/last_run.json";
 }
 
+std::optional<PlatformError> writeRunBegin(Date start, const std::string& taskingFile,
+                                           const std::string& stateDirectory) {
+  RunHistory history = usableHistory(stateDirectory);
+  const Boot boot = thisBoot();
+  history.runs.push_back({start, {}, {}, boot.id, boot.began, fileTime(taskingFile)});
+  return writeHistory(std::move(history), stateDirectory);
+}
+
 std::optional<PlatformError> writeRunRecord(const RunRecord& record,
                                             const std::string& stateDirectory) {
   // A run that was not tasked read nothing, so it must not replace the record of a run that did.
   TESSEL_INVARIANT(record.outcome != RunOutcome::notTasked);
-  std::string text;
-  JsonWriter json(text, {.indent = 1});
-  json.object([&] {
-    json.member("start", record.start).member("end", record.end);
-    json.member("outcome", runOutcomeName(record.outcome));
-    json.member("failure", shortPlainText(record.failure, kMaxFailureBytes));
-    json.member("log_events", record.logEvents).member("inspected", record.inspected);
-    json.array("classified", record.classified, [&](uint64_t count) { json.value(count); });
-    json.member("unnamed", record.unnamed).member("unsendable", record.unsendable);
-    json.member("count_events", record.countEvents);
-    if (record.reading) json.object("reading", [&] { addReading(json, *record.reading); });
-    json.member("rows_stored", record.rowsStored).member("rows_expired", record.rowsExpired);
-    json.object("rows_failed", [&] {
-      for (const auto& [reason, count] : record.rowsFailed) json.member(reason, count);
-    });
-    json.array("set_aside", record.setAside, [&](const std::string& name) { json.value(name); });
-    json.member("marker", record.marker);
-    json.object("totals", [&] {
-      json.member("expired", record.totals.expired);
-      json.object("failed", [&] {
-        for (const auto& [reason, count] : record.totals.failed) json.member(reason, count);
-      });
-    });
-  });
-  return replaceFileDurably(runRecordPath(stateDirectory), text + "\n");
+  RunHistory history = usableHistory(stateDirectory);
+  const auto begun = std::find_if(history.runs.rbegin(), history.runs.rend(),
+                                  [&](const RunNote& note) { return note.start == record.start; });
+  // The begin may not have been written, for want of room.
+  RunNote& note = begun != history.runs.rend() ? *begun : history.runs.emplace_back(noteOf(record));
+  note.end = record.end;
+  note.outcome = record.outcome;
+  history.last = record;
+  return writeHistory(std::move(history), stateDirectory);
+}
+
+std::variant<RunHistory, PlatformError> readRunHistory(const std::string& stateDirectory) {
+  const std::string path = runRecordPath(stateDirectory);
+  auto content = readOwnFile(path, kMaxRunRecordBytes);
+  if (auto* error = std::get_if<PlatformError>(&content)) {
+    if (error->code == ErrorCode::notFound) return RunHistory{};
+    return std::move(*error);
+  }
+  try {
+    return historyFrom(Json::parse(std::get<std::string>(content)));
+  } catch (const nlohmann::json::exception&) {
+    // Half a record would show books that do not balance, so a damaged record counts as none.
+    return PlatformError{ErrorCode::failed, path + ": it is damaged, or of a newer version"};
+  }
 }
 
 std::optional<RunRecord> readRunRecord(const std::string& stateDirectory) {
-  const auto content = readOwnFile(runRecordPath(stateDirectory), kMaxRunRecordBytes);
-  const auto* text = std::get_if<std::string>(&content);
-  if (text == nullptr) return {};
-  try {
-    return recordFrom(Json::parse(*text));
-  } catch (const nlohmann::json::exception&) {
-    // Half a record would show books that do not balance, so a damaged record counts as none.
-    return {};
-  }
+  return usableHistory(stateDirectory).last;
 }
 
 }  // namespace tessel

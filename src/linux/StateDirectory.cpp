@@ -99,6 +99,12 @@ std::optional<RunLock> StateDirectory::lock(int operation) const {
   return RunLock(std::move(directory));
 }
 
+bool StateDirectory::isLocked() const {
+  const UniqueFd directory = openDirectory(path_);
+  return directory.valid() && ::flock(directory.get(), LOCK_SH | LOCK_NB) != 0 &&
+         errno == EWOULDBLOCK;
+}
+
 std::optional<RunLock> StateDirectory::tryLock() const { return lock(LOCK_EX | LOCK_NB); }
 
 std::optional<RunLock> StateDirectory::waitForLock() const { return lock(LOCK_EX); }

@@ -51,6 +51,10 @@ class StateDirectory {
   const std::string& path() const { return path_; }
   std::string deferFile() const { return path_ + "/defer"; }
 
+  // Whether somebody holds the right to run. To find out takes it, shared, for an instant. A
+  // process that wants to run in that instant waits until it is free again.
+  bool isLocked() const;
+
   // The right to run. Absent if another holder has it.
   std::optional<RunLock> tryLock() const;
   // Waits for the right to run. Absent if the directory cannot be opened or locked.

@@ -7,6 +7,7 @@
 
 #include <fcntl.h>
 #include <poll.h>
+#include <systemd/sd-bus.h>
 #include <unicode/datefmt.h>
 #include <unicode/locid.h>
 #include <unicode/simpletz.h>
@@ -20,6 +21,7 @@
 #include <utility>
 
 #include "os/Files.h"
+#include "platform/Text.h"
 
 namespace tessel {
 
@@ -40,6 +42,59 @@ void SystemClock::sleepMicroseconds(uint32_t microseconds) {
 
 bool SystemClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
   return semaphore.waitFor(timeout);
+}
+
+Boot thisBoot() {
+  SystemClock clock;
+  const auto upFor = std::chrono::nanoseconds{static_cast<int64_t>(clock.continuousTicks())};
+  std::string id(trimmed(readSmallFile("/proc/sys/kernel/random/boot_id", 64).value_or("")));
+  return {std::move(id), clock.now() - std::chrono::floor<Date::duration>(upFor),
+          std::chrono::floor<std::chrono::seconds>(upFor)};
+}
+
+namespace {
+
+struct CloseBus {
+  void operator()(sd_bus* bus) const { sd_bus_flush_close_unref(bus); }
+};
+using Bus = std::unique_ptr<sd_bus, CloseBus>;
+
+Bus systemBus() {
+  sd_bus* bus = nullptr;
+  if (sd_bus_open_system(&bus) >= 0) return Bus(bus);
+  // A small machine has no message bus. Root can then ask the manager itself.
+  Bus direct(sd_bus_new(&bus) >= 0 ? bus : nullptr);
+  if (direct && (sd_bus_set_address(direct.get(), "unix:path=/run/systemd/private") < 0 ||
+                 sd_bus_start(direct.get()) < 0)) {
+    return {};
+  }
+  return direct;
+}
+
+// The object of a unit: its name, with every byte but letters and digits as _ and two hexadecimal
+// digits.
+std::string objectOf(const std::string& unit) {
+  char* path = nullptr;
+  if (sd_bus_path_encode("/org/freedesktop/systemd1/unit", unit.c_str(), &path) < 0) return {};
+  const std::unique_ptr<char, decltype(&std::free)> freed(path, &std::free);
+  return path;
+}
+
+}  // namespace
+
+std::optional<Date> nextElapseOf(const std::string& timer) {
+  const Bus bus = systemBus();
+  const std::string object = objectOf(timer);
+  if (!bus || object.empty()) return {};
+  sd_bus_set_method_call_timeout(bus.get(), 1'000'000);
+  uint64_t next = 0;  // microseconds since 1970; 0 or the greatest number: it does not elapse
+  if (sd_bus_get_property_trivial(bus.get(), "org.freedesktop.systemd1", object.c_str(),
+                                  "org.freedesktop.systemd1.Timer", "NextElapseUSecRealtime",
+                                  nullptr, 't', &next) < 0 ||
+      next == 0 || next > INT64_MAX) {
+    return {};
+  }
+  return Date{std::chrono::microseconds{static_cast<int64_t>(next)}};
 }
 
 namespace {

@@ -27,6 +27,18 @@ class SystemClock final : public Clock {
   bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
 };
 
+// The boot that this machine is in. Any thread.
+struct Boot {
+  std::string id;  // another one for each boot; empty if the kernel does not tell it
+  Date began{};    // by the wall clock as it is set now; the time asleep counts
+  std::chrono::seconds upFor{};
+};
+Boot thisBoot();
+
+// When the timer of the service manager elapses next. Absent if no service manager answers, or if
+// the timer is not active. Any thread.
+std::optional<Date> nextElapseOf(const std::string& timer);
+
 // The value that the text of an os-release file gives `name`, without its quotes. Of several lines
 // the last counts, as for a shell that reads the file. Empty if there is none. Points into `text`.
 std::string_view osReleaseValue(std::string_view text, std::string_view name);

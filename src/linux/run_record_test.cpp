@@ -68,6 +68,8 @@ RunRecord mixedDay() {
   record.rowsFailed = {{"locked", 1}, {"disk_full", 2}, {"limit", 0}};
   record.addTotals({5, {{"locked", 7}, {"read_only", 3}}});
   EXPECT_EQ(record.totals, (RowTotals{17, {{"disk_full", 2}, {"locked", 8}, {"read_only", 3}}}));
+  record.expiredSince = 4;
+  record.interval = std::chrono::seconds{86'400};
   record.setAside = {"statora.db.damaged-20261118T110640Z"};
   record.marker = "removed";
   record.logEvents = 18'446'744'073'709'551'615u;
@@ -82,6 +84,28 @@ TEST(RunRecordTest, ReadsBackWhatWasWritten) {
   ASSERT_FALSE(writeRunRecord(mixedDay(), directory.path()));
   EXPECT_EQ(readRunRecord(directory.path()), mixedDay());
   EXPECT_TRUE(writeRunRecord(mixedDay(), directory.path("missing")).has_value());
+}
+
+TEST(RunRecordTest, ABeginStaysWithoutEndIfNoneFollows) {
+  const TemporaryDirectory directory;
+  const auto runs = [&] { return std::get<RunHistory>(readRunHistory(directory.path())).runs; };
+  RunRecord record = mixedDay();
+  ASSERT_FALSE(writeRunBegin(record.start, directory.path("none"), directory.path()));
+  EXPECT_FALSE(readRunRecord(directory.path())) << "no run has come to its end";
+  EXPECT_FALSE(runs().at(0).end || runs().at(0).outcome || runs().at(0).taskingWritten);
+  EXPECT_FALSE(runs().at(0).boot.empty());
+  const RunNote dead = runs().at(0);
+  for (size_t at = 1; at <= RunHistory::kMaxRuns; ++at) {
+    record.start += std::chrono::hours{24};
+    ASSERT_FALSE(writeRunBegin(record.start, directory.path(), directory.path()));
+    EXPECT_EQ(runs().size() == RunHistory::kMaxRuns && runs().at(0) != dead,
+              at == RunHistory::kMaxRuns);
+    ASSERT_FALSE(writeRunRecord(record, directory.path()));
+    EXPECT_EQ(runs().back().end, record.end);
+    EXPECT_EQ(runs().back().outcome, record.outcome);
+    EXPECT_TRUE(runs().back().taskingWritten);
+  }
+  EXPECT_EQ(readRunRecord(directory.path()), record);
 }
 
 TEST(RunRecordTest, ARecordThatIsNotWholeIsNone) {
@@ -126,6 +150,8 @@ TEST(RunRecordTest, OneOfAnOlderServiceHasNoReading) {
   const auto record = readRunRecord(directory.path());
   ASSERT_TRUE(record);
   EXPECT_FALSE(record->reading);
+  const RunNote note{record->start, record->end, RunOutcome::completed, {}, {}, {}};
+  EXPECT_EQ(std::get<RunHistory>(readRunHistory(directory.path())).runs, std::vector{note});
   EXPECT_TRUE(record->objectsBalance() && record->rowsBalance());
 }
 
@@ -134,6 +160,8 @@ TEST(RunRecordTest, ItStaysSmallAndItsSumsStayWhole) {
   RunRecord record = mixedDay();
   record.failure = std::string(4096, '\x01');
   record.reading = hugeDay();
+  for (size_t at = 0; at < RunHistory::kMaxRuns; ++at)
+    ASSERT_FALSE(writeRunBegin(record.start, directory.path(), directory.path()));
   ASSERT_FALSE(writeRunRecord(record, directory.path()));
   EXPECT_LT(std::filesystem::file_size(directory.path("last_run.json")), size_t{1} << 17);
   const auto reread = readRunRecord(directory.path());

@@ -1,17 +1,19 @@
 // RunRecord: the result of one run, with all its counts.
 //
-// The run fills it, and main.cpp adds what became of the spool's rows and of the run marker. The
-// record is then kept as `<state>/last_run.json`; each run replaces the record of the run before.
+// The run fills it, and main.cpp adds what became of the spool's rows and of the run marker. It is
+// then kept as `<state>/last_run.json`; each run replaces the record of the run before.
 //
-// A run that dies leaves neither a record nor the scheduler's note of its begin, because both are
-// written at the end. Only the run marker tells of it. The scheduler's note is newer than the
-// record where the last run was not tasked, or where its record could not be written.
+// RunNote: begin and end of a run. The note is written before the run begins, so a run that dies
+// leaves one without an end. The file keeps the notes of the last runs beside the record.
 //
-// A plain value; one thread at a time.
+// A run that was not tasked leaves neither. The scheduler's note of it is then newer than ours.
+//
+// Plain values; one thread at a time.
 
 #pragma once
 
 #include <array>
+#include <chrono>
 #include <cstdint>
 #include <map>
 #include <numeric>
@@ -72,6 +74,12 @@ struct RunRecord {
   std::vector<std::string> setAside;                         // file names of damaged spools
   std::string marker;                                        // "removed" or "still there"
   RowTotals totals;                                          // this run's rows included
+  // Rows that runs after this one removed because of their age. They were not tasked, so they have
+  // no record of their own.
+  uint64_t expiredSince = 0;
+  // The setting of the service, which whoever reads the record need not have. Absent if something
+  // else starts each run, and in the record of an older service.
+  std::optional<std::chrono::seconds> interval;
 
   // Whether the run got as far as sending anything.
   bool hasBooks() const {
@@ -99,6 +107,36 @@ struct RunRecord {
   }
 
   bool operator==(const RunRecord&) const = default;
+};
+
+struct RunNote {
+  Date start{};
+  // Both are absent while the run is under way, and for ever if it died.
+  std::optional<Date> end;
+  std::optional<RunOutcome> outcome;
+  // The boot that it ran in, and when that boot began by the wall clock of that moment. If the
+  // clock is set, the same boot seems to begin at another time: by that we notice it. Empty and
+  // absent in what an older service wrote.
+  std::string boot;
+  std::optional<Date> bootBegan;
+  // When the file that switches reporting on was written. Absent if there is none.
+  std::optional<Date> taskingWritten;
+
+  // Whether the run did what it is for. What an interrupted run has read, it has reported.
+  bool reported() const {
+    return outcome == RunOutcome::completed || outcome == RunOutcome::interrupted;
+  }
+  bool operator==(const RunNote&) const = default;
+};
+
+struct RunHistory {
+  // Enough for a week of a machine on which each second run dies, and still a small file.
+  static constexpr size_t kMaxRuns = 16;
+
+  std::vector<RunNote> runs;      // the last ones, oldest first
+  std::optional<RunRecord> last;  // of the last run that came to its end
+
+  bool operator==(const RunHistory&) const = default;
 };
 
 }  // namespace tessel

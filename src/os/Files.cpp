@@ -87,6 +87,14 @@ std::variant<std::string, PlatformError> readOwnFile(const std::string& path, si
   return *std::move(text);
 }
 
+std::optional<Date> fileTime(const std::string& path) {
+  struct stat facts {};
+  if (::lstat(path.c_str(), &facts) != 0) return {};
+  return Date{
+      std::chrono::duration_cast<Date::duration>(std::chrono::seconds{facts.st_mtim.tv_sec} +
+                                                 std::chrono::nanoseconds{facts.st_mtim.tv_nsec})};
+}
+
 bool writeAll(int fd, std::string_view text) {
   while (!text.empty()) {
     const ssize_t count = ::write(fd, text.data(), text.size());

@@ -13,6 +13,7 @@
 
 #include "os/UniqueFd.h"
 #include "platform/Error.h"
+#include "platform/System.h"
 
 namespace tessel {
 
@@ -30,6 +31,10 @@ std::optional<std::string> readSmallFile(const std::string& path, size_t maximum
 // that directory too, so the file must be a regular file, no link, and belong to the owner of the
 // directory. The error says what it is instead. Never waits, whatever stands at the path.
 std::variant<std::string, PlatformError> readOwnFile(const std::string& path, size_t maximum);
+
+// When the content of the file was last written. For a link, when the link was made. Absent if
+// there is no such path, or if it may not be looked at.
+std::optional<Date> fileTime(const std::string& path);
 
 // Writes all of `text`. False, with errno set, if that fails.
 bool writeAll(int fd, std::string_view text);

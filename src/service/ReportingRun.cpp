@@ -156,22 +156,23 @@ void TraceReading::installCallbacks(TesselSupportObjectExtractor& extractor,
 
 void ReportingRun::performReportingRun(const std::shared_ptr<Activity>& activity) {
   const Date began = clock_.now();
-  RunRecord record = attempt(activity);
+  RunRecord record = attempt(activity, began);
   record.start = began;
   record.end = clock_.now();
   // The disk may need minutes for the rows that still wait, so this is no idle process yet.
   status_.say("storing the last rows");
-  runEnded_(record);
+  book_.ended(record);
   status_.say("idle");
 }
 
-RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity) {
+RunRecord ReportingRun::attempt(const std::shared_ptr<Activity>& activity, Date began) {
   status_.say("waiting for the tasking configuration");
   const TaskingDecision decision = gate_.decide();
   // Nobody knows whether this machine is tasked, so the run must not pass for one that was not.
   if (decision.reason == TaskingReason::notLookedAt)
     return endedWith(RunOutcome::failed, "the tasking configuration could not be looked at");
   if (!decision.on()) return endedWith(RunOutcome::notTasked);
+  book_.begun(began);
   if (cookie_.cookieFileExists()) {
     // What the dead run read may have killed it, so this run reads nothing. It removes the marker,
     // so the next run reads again.

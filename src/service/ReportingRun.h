@@ -98,32 +98,38 @@ class TraceReading {
   ServiceStatus& status_;
 };
 
-// Gets the record of each run, on the run's thread, after the last step of the run. The callback
-// adds what the run cannot know: what the spool stored, and whether the marker is gone.
-using RunEndedCallback = std::function<void(const RunRecord&)>;
+// What keeps the books of the runs. Both are called on the run's thread.
+struct RunBook {
+  // Before a run that is tasked does anything else, with its begin. If the run then dies, the begin
+  // tells that there was one.
+  std::function<void(Date)> begun;
+  // With the record of each run, after its last step. It adds what the run cannot know: what the
+  // spool stored, and whether the marker is gone. A run that was not tasked ends without a begin.
+  std::function<void(const RunRecord&)> ended;
+};
 
 class ReportingRun {
  public:
   ReportingRun(TaskingGate& gate, CookieFile& cookie, TraceReading& reading, Clock& clock,
-               ServiceStatus& status, RunEndedCallback runEnded)
+               ServiceStatus& status, RunBook book)
       : gate_(gate),
         cookie_(cookie),
         reading_(reading),
         clock_(clock),
         status_(status),
-        runEnded_(std::move(runEnded)) {}
+        book_(std::move(book)) {}
 
   void performReportingRun(const std::shared_ptr<Activity>& activity);
 
  private:
-  RunRecord attempt(const std::shared_ptr<Activity>& activity);
+  RunRecord attempt(const std::shared_ptr<Activity>& activity, Date began);
 
   TaskingGate& gate_;
   CookieFile& cookie_;
   TraceReading& reading_;
   Clock& clock_;
   ServiceStatus& status_;
-  const RunEndedCallback runEnded_;
+  const RunBook book_;
 };
 
 class ReporterActivity {

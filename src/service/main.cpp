@@ -78,7 +78,8 @@ void addRows(RunRecord& record, const SpoolFigures& figures) {
 
 // Writes the record of a run for `tesselctl status`. The spool knows how many rows it stored only
 // when the run has ended, which takes as long as the disk needs.
-void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirectory) {
+void keepRecord(RunRecord record, Spool& spool, const LaunchConfiguration& launch,
+                const std::string& stateDirectory) {
   const SpoolFigures figures = spool.endRun();
   const std::optional<RunRecord> last = readRunRecord(stateDirectory);
   if (record.outcome == RunOutcome::notTasked) {
@@ -86,15 +87,31 @@ void keepRecord(RunRecord record, Spool& spool, const std::string& stateDirector
     if (!last || figures.expired == 0) return;
     record = *last;
     record.totals.expired += figures.expired;
+    record.expiredSince += figures.expired;
   } else {
     addRows(record, figures);
     record.addTotals(last ? last->totals : RowTotals{});
     record.marker = LocalFiles().existence(cookieFilePath).exists ? "still there" : "removed";
+    record.interval = launch.activityInterval;
     logFindings(record);
   }
   if (const auto failure = writeRunRecord(record, stateDirectory)) {
     platformLog().warning("The record of the run is not written: %@", failure->words);
   }
+}
+
+RunBook bookOfRuns(const LaunchConfiguration& launch, const StateDirectory& state, Spool& spool,
+                   SerialQueue& reportingQueue) {
+  const std::string taskingFile = launch.configurationDirectory + "/" + kTaskingType + ".json";
+  return {[&state, taskingFile](Date begun) {
+            // If this fails, the end of the run most likely cannot be written either, and that is a
+            // warning.
+            writeRunBegin(begun, taskingFile, state.path());
+          },
+          [launch, &state, &spool, &reportingQueue](const RunRecord& record) {
+            // Only this queue may use the spool; all sends run there, too.
+            reportingQueue.sync([&] { keepRecord(record, spool, launch, state.path()); });
+          }};
 }
 
 // Makes the parts that take an object from the store to the spool.
@@ -144,10 +161,7 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
   auto& spool = keep<Spool>(state.path(), limits, clock, status, writerQueue, queues);
   auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
-                            [&spool, &state, &reportingQueue](const RunRecord& record) {
-                              // Only this queue may use the spool; all sends run there, too.
-                              reportingQueue.sync([&] { keepRecord(record, spool, state.path()); });
-                            });
+                            bookOfRuns(launch, state, spool, reportingQueue));
 }
 
 [[noreturn]] void serve() {

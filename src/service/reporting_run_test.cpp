@@ -72,15 +72,16 @@ class RunTest : public ::testing::Test {
                        reportingQueue,
                        clock,
                        status};
-  ReportingRun run{gate,  cookie, reading,
-                   clock, status, [this](const RunRecord& record) { records.push_back(record); }};
+  RunBook book{[this](Date) { log.write(LogLevel::debug, "", "", "(begun)"); },
+               [this](const RunRecord& record) { records.push_back(record); }};
+  ReportingRun run{gate, cookie, reading, clock, status, book};
 };
 
 TEST_F(RunTest, GoesThroughItsStepsInOrder) {
   extractor->duringProcessing = [this] { EXPECT_TRUE(files.items.contains(cookieFilePath)); };
   perform();
   EXPECT_THAT(linesBeforeSummary(),
-              ElementsAre("Reporting based on os_flavor result", "Created cookie file",
+              ElementsAre("Reporting based on os_flavor result", "(begun)", "Created cookie file",
                           "(extractor made)", "Filesystem for '/': ext4", "Boot disk type: SSD"));
   EXPECT_EQ(log.lines().back(), "Cleared cookie file");
   EXPECT_THAT(extractor->calls, ElementsAre("interval callback", "animation callback",
@@ -138,7 +139,7 @@ TEST_F(RunTest, AMarkerMakesOnlyOneRunBailOut) {
   files.items[cookieFilePath] = true;
   perform();
   EXPECT_THAT(log.lines(),
-              ElementsAre("Reporting based on os_flavor result",
+              ElementsAre("Reporting based on os_flavor result", "(begun)",
                           "Cookie file exists but is directory", "Bailing due to cookie file",
                           "Cookie file exists but is directory", "Cleared cookie file"));
   EXPECT_TRUE(sender.events.empty());
@@ -334,10 +335,9 @@ TEST_F(RunTest, TheBooksAreSentAndLogged) {
   const std::string from = dates.format(extractor->startDate);
   const std::string to = dates.format(extractor->endDate);
   EXPECT_EQ(log.count("Done processing 2 reported and 1 unreported events, 1 reported and 2 "
-                      "unreported intervals and 1 "
-                      "reported and 1 unreported animations (1 blacklisted, 1 too short, 0 "
-                      "whitelisted, 2 telemetry not "
-                      "enabled) from 99 log events in 1.25s between " +
+                      "unreported intervals and 1 reported and 1 unreported animations (1 "
+                      "blacklisted, 1 too short, 0 whitelisted, 2 telemetry not enabled) from 99 "
+                      "log events in 1.25s between " +
                       from + " and " + to + "\n"),
             1u);
 }
