@@ -1,20 +1,15 @@
-// status: does this machine report, and do the books balance?
+// status: does this machine report, and is all well with it?
 //
-// Scripts act on the exit status, so it is bad only if the reporter itself failed. The screen also
-// shows entries that the journal lost and a machine that is not tasked. Neither is a failure of the
-// reporter, so neither changes the exit status.
-
-#include <unistd.h>
+// Scripts act on the exit status, so it is bad exactly where there is a problem. Notes tell what
+// any user of the machine can cause; they do not change it.
 
 #include <algorithm>
-#include <cerrno>
 #include <functional>
 
-#include "os/Files.h"
-#include "platform/Text.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/showing/Losses.h"
+#include "tesselctl/showing/StatusScreen.h"
 #include "tesselctl/showing/SummaryOutput.h"
 
 namespace tessel::ctl {
@@ -51,6 +46,18 @@ void writeRun(JsonWriter& json, const RunRecord& run, bool hasBooks) {
   if (run.reading) json.object("reading", [&] { addReading(json, *run.reading); });
 }
 
+void writeRuns(JsonWriter& json, const ReporterStatus& status) {
+  json.array("runs", status.runs, [&](const RunNote& note) {
+    json.object([&] {
+      json.member("start", note.start).member("end", note.end);
+      const bool underWay = status.underWay && &note == &status.runs.back();
+      json.member("outcome", note.outcome ? runOutcomeName(*note.outcome)
+                             : underWay   ? "under_way"
+                                          : "died");
+    });
+  });
+}
+
 void writeSpool(JsonWriter& json, const ReporterStatus& status) {
   // In the order of SpoolReader::State, which indexes them.
   static constexpr std::string_view kStates[] = {"open", "absent", "no_access", "damaged"};
@@ -58,6 +65,7 @@ void writeSpool(JsonWriter& json, const ReporterStatus& status) {
   // A spool that we could not read has no figures. Zero rows would pass for an empty spool.
   if (status.spoolState == SpoolReader::State::open) {
     json.member("rows", status.spool.rows).member("bytes", status.spool.bytes);
+    json.member("used_bytes", status.spool.bytesOfWaiting).member("limit", status.spoolLimitBytes);
     json.member("oldest", status.spool.oldest).member("newest", status.spool.newest);
   } else {
     json.member("reason", status.spoolFailure);
@@ -88,6 +96,9 @@ void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("requests", counters.requests).member("retries", counters.retries);
   json.member("bytes_sent", counters.bytesSent).member("position", counters.position);
   json.member("last_success", counters.lastSuccess);
+  if (counters.lastErrorAt == 0) return;
+  json.member("last_error", counters.lastError).member("last_error_at", counters.lastErrorAt);
+  if (counters.orderedUntil != 0) json.member("ordered_until", counters.orderedUntil);
 }
 
 void writeFindings(JsonWriter& json, std::string_view name, const std::vector<Finding>& findings,
@@ -118,6 +129,9 @@ std::string statusJson(const ReporterStatus& status) {
       json.member("source", taskingSourceName(status.tasking.decision.source()));
       json.member("file", status.tasking.file);
     });
+    json.object("next_run", [&] {
+      json.member("by", nextRunName(status.nextRun.by)).member("at", status.nextRun.at);
+    });
     json.object("deferral", [&] {
       json.member("wanted", status.deferral.has_value()).member("reason", status.deferral);
     });
@@ -126,6 +140,7 @@ std::string statusJson(const ReporterStatus& status) {
                [&](const PlatformError& error) { json.value(error.words); });
     if (status.run)
       json.object("last_run", [&] { writeRun(json, *status.run, status.hasBooks()); });
+    writeRuns(json, status);
     json.member("last_begin", status.lastBegin);
     json.object("spool", [&] { writeSpool(json, status); });
     if (status.spool.forwarder)
@@ -137,242 +152,26 @@ std::string statusJson(const ReporterStatus& status) {
   });
 }
 
-// One screen for a human.
-class Screen {
- public:
-  Screen(const ReporterStatus& status, const Terminal& terminal)
-      : status_(status),
-        terminal_(terminal),
-        store_(status.store.value_or("the journal of this machine")) {}
-
-  std::string render() {
-    line("Tasking", status_.tasking.decision.on() ? "on" : "off",
-         status_.tasking.decision.on() ? Colour::good : Colour::caution, status_.taskingWords);
-    line("Deferral", status_.deferral ? "wanted" : "none",
-         status_.deferral ? Colour::caution : Colour::plain,
-         status_.deferral.value_or("nothing speaks against a run now"));
-    lastRun();
-    for (const Marker& each : status_.markers) marker(each);
-    spool();
-    if (status_.spool.forwarder) forwarder(*status_.spool.forwarder);
-    journal();
-    return out_;
-  }
-
- private:
-  static constexpr size_t kLabelWidth = 12;
-  static constexpr size_t kAnswerWidth = 13;
-  static constexpr size_t kLossesOfACode = 5;  // a store of many bad files must not fill the screen
-
-  void line(std::string_view label, std::string_view answer, Colour colour,
-            const std::string& words) {
-    std::string left(label);
-    left.resize(kLabelWidth, ' ');
-    std::string middle(answer);
-    // A long answer pushes its words to the right: without the one space the two would touch.
-    middle.resize(std::max(middle.size() + 1, kAnswerWidth), ' ');
-    const size_t indent = kLabelWidth + kAnswerWidth;
-    out_ += left + terminal_.paint(colour, middle);
-    out_ += wrappedBeside(terminalText(words), terminal_.width, indent);
-    // Some answers need no words. The padding of the answer would then end the line with spaces.
-    out_.erase(out_.find_last_not_of(' ') + 1);
-    out_ += '\n';
-  }
-  void more(const std::string& words) { line("", "", Colour::plain, words); }
-
-  std::string since(Date date) const {
-    return dateText(date) + " (" + durationText(status_.now - date) + " ago)";
-  }
-
-  void lastRun() {
-    if (!status_.run) {
-      line("Last run", "none", Colour::plain, "no record of a run in the state directory");
-    } else {
-      const RunRecord& run = *status_.run;
-      // Only a failed run makes good() false, so only a failed run is red. Every other outcome that
-      // is not complete is a caution.
-      const bool bad = run.outcome == RunOutcome::failed;
-      const bool well = run.outcome == RunOutcome::completed;
-      line("Last run", runOutcomeName(run.outcome),
-           bad    ? Colour::bad
-           : well ? Colour::good
-                  : Colour::caution,
-           since(run.start) + ", took " + durationText(run.end - run.start));
-      if (!run.failure.empty()) more(run.failure);
-      if (run.outcome == RunOutcome::bailedOut)
-        more("the marker of a run that died stood there; it is removed");
-      if (status_.hasBooks()) books(run);
-      if (run.reading) store(*run.reading, run.logEvents);
-    }
-    for (const PlatformError& refused : status_.refusedFiles) more(refused.words);
-    // The scheduler notes the begin of a run once the run has ended. So a begin after the end of
-    // the recorded run belongs to a later run, and that one left no record.
-    if (status_.runWithoutRecord()) {
-      more(std::string(status_.run ? "A later run began " : "A run began ") +
-           since(*status_.lastBegin) +
-           " and left no record: it was not tasked, or the record could not be written.");
-    }
-  }
-
-  void books(const RunRecord& run) {
-    // We print the whole sum, not only its result. Where the books do not balance, the reader sees
-    // which figure is the wrong one. kVerdictOrder names each verdict once, so the sum is complete.
-    std::string sums = grouped(run.inspected) + " inspected of " +
-                       counted(run.logEvents, "log event", "log events") + " =";
-    std::string plus = " ";
-    for (const auto verdict : kVerdictOrder) {
-      sums += plus + grouped(run.classified[verdict]) + " " + std::string(verdictName(verdict));
-      plus = " + ";
-    }
-    balance("Objects", run.objectsBalance(), sums);
-    std::string rows =
-        grouped(run.rowsStored) + " rows stored, expected 2 x " + grouped(run.reported()) +
-        (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
-        (run.unsendable == 0 ? "" : " - 2 x " + grouped(run.unsendable) + " without a payload") +
-        " + " + grouped(run.countEvents) + " counts + 1";
-    if (!run.rowsBalance()) rows += " = " + grouped(run.rowsExpected());
-    balance("Rows", run.rowsBalance(), rows);
-    for (const auto& [reason, count] : run.rowsFailed) {
-      if (count != 0) more(grouped(count) + " rows failed: " + reason);
-    }
-    if (run.rowsExpired != 0) more(grouped(run.rowsExpired) + " rows of earlier runs expired");
-    for (const std::string& name : run.setAside) more("a damaged spool was set aside as " + name);
-  }
-  void balance(std::string_view what, bool balances, const std::string& words) {
-    line(what, balances ? "balance" : "DO NOT", balances ? Colour::good : Colour::bad,
-         balances ? words : "balance: " + words);
-  }
-
-  // A store may lose entries before the run reads it. The reporter cannot help that, so a loss is a
-  // caution and not a failure.
-  void store(const StoreReading& reading, uint64_t entries) {
-    std::string words = counted(reading.filesRead, "file", "files") + " and " +
-                        counted(entries, "entry", "entries") + " read";
-    if (reading.filesOutsideRange != 0)
-      words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
-    const std::string part = partOfPeriod(reading);
-    // A store may be undamaged and yet too young for the period, so both must hold.
-    const bool whole = part.empty() && reading.losses.empty() && !reading.stopped;
-    line("Store", whole ? "whole" : "not whole", whole ? Colour::good : Colour::caution, words);
-    if (!part.empty()) more(part);
-    if (reading.stopped) more(unreadPart(reading));
-    for (const std::string& loss : lossLines(reading.losses, kLossesOfACode)) more(loss);
-  }
-
-  // The file alone does not tell a run at work from one that died. We say both and give the age of
-  // the file, from which a reader can tell.
-  void marker(const Marker& marker) {
-    const bool ofUnit = marker.of == MarkerOf::unit;
-    const std::string run = ofUnit ? "run under the unit" : "run by hand";
-    switch (marker.state) {
-      case Marker::State::absent:
-        // On a machine with the unit, few run the service by hand. We spare those a line.
-        if (ofUnit || status_.markers.size() == 1)
-          line("Marker", "none", Colour::plain, "no " + run + " is reporting, and none died");
-        return;
-      case Marker::State::present:
-        line("Marker", "present", Colour::caution,
-             marker.path + " of " + marker.owner + ", since " + since(marker.since) + ": a " + run +
-                 " is reporting, or died; then the next one only removes it");
-        return;
-      case Marker::State::cannotBeSeen:
-        line("Marker", "unknown", Colour::caution,
-             marker.path + " cannot be seen; root may look whether a " + run + " died");
-        return;
-    }
-  }
-
-  // An absent spool is plain, because a machine that was never tasked has none. Only a damaged one
-  // is a failure: a user without access cannot know its state.
-  void spool() {
-    switch (status_.spoolState) {
-      case SpoolReader::State::open:
-        break;
-      case SpoolReader::State::absent:
-        line("Spool", "none", Colour::plain, "nothing was sent");
-        return;
-      case SpoolReader::State::noAccess:
-        line("Spool", "no access", Colour::caution, status_.spoolFailure);
-        return;
-      case SpoolReader::State::damaged:
-        line("Spool", "DAMAGED", Colour::bad, status_.spoolFailure);
-        return;
-    }
-    const SpoolContents& spool = status_.spool;
-    // Rounded up: a spool with rows in it must not seem to be empty.
-    std::string words = grouped((spool.bytes + 1023) / 1024) + " KiB";
-    // An empty spool has no oldest row. If there is an oldest row, there is a newest one.
-    if (spool.oldest) {
-      words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
-               dateText(Date{std::chrono::microseconds{*spool.newest}});
-    }
-    line("Spool", grouped(static_cast<uint64_t>(spool.rows)) + " rows", Colour::plain, words);
-  }
-
-  void forwarder(const ForwarderCounters& counters) {
-    // Retries are no trouble: collectors are away now and then, and nothing is lost by waiting.
-    const bool trouble = counters.rejected + counters.setAside > 0;
-    std::string words = grouped(counters.delivered) + " delivered in " +
-                        counted(counters.requests, "request", "requests") + ", " +
-                        grouped(counters.retries) + " again, " + grouped(counters.rejected) +
-                        " rejected, " + grouped(counters.setAside) + " set aside";
-    if (counters.lastSuccess != 0) {
-      const auto last = static_cast<int64_t>(counters.lastSuccess);
-      words += "; last " + since(Date{std::chrono::microseconds{last}});
-    }
-    line("Forwarder", trouble ? "refused some" : "in use",
-         trouble ? Colour::caution : Colour::plain, words);
-  }
-
-  // A run looks back 24 hours. If the oldest entry is younger, a run misses the time before it
-  // without any sign of damage.
-  void journal() {
-    if (status_.journal.failure) {
-      line("Journal", "unreadable", Colour::bad, status_.journal.failure->words);
-    } else if (!status_.journal.oldest) {
-      line("Journal", "empty", Colour::plain, store_);
-    } else {
-      const bool whole = status_.keepsADay();
-      line("Journal", whole ? "whole day" : "part of day", whole ? Colour::good : Colour::caution,
-           store_ + ": oldest entry " + since(*status_.journal.oldest) +
-               (whole ? "" : "; a run looks back 24 h"));
-    }
-  }
-
-  const ReporterStatus& status_;
-  const Terminal& terminal_;
-  const std::string store_;
-  std::string out_;
-};
-
 struct StatusOptions {
   bool json = false;
 };
 
 int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
-  const std::string& directory = surroundings.launch.stateDirectory;
-  // A file that we may not reach looks like a file that is absent. Without this check the screen
-  // would report a healthy machine that never ran.
-  if (::access(directory.c_str(), R_OK | X_OK) != 0 && errno == EACCES)
-    return failToRead(fileError("state directory " + directory, EACCES), directory);
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
-  print(options.json ? statusJson(status) : Screen(status, surroundings.terminal).render());
+  print(options.json ? statusJson(status) : statusScreen(status, surroundings.terminal));
   flushOutput();
-  // The screen is printed first: facts that this user may read are worth showing. A refusal
-  // outranks the verdict of good(), since another user may get another answer.
-  if (status.journal.failure && status.journal.failure->code == ErrorCode::noAccess)
-    return failToRead(*status.journal.failure, status.store);
-  if (status.spoolState == SpoolReader::State::noAccess) return kNoAccess;
-  return status.good() ? kDone : kBad;
+  if (status.good()) return kDone;
+  // What this user may not see outranks what he sees, since another user may get another answer.
+  // The screen is printed first: facts that he may see are worth showing.
+  const Finding& first = status.findings.front();
+  if (first.code != FindingCode::noAccess) return kBad;
+  return failToRead({ErrorCode::noAccess, first.words}, status.stateDirectory);
 }
 
 const CommandText kStatus{
-    "status", "Say whether this machine reports, and whether the books balance",
-    "The books of the last run balance where inspected = reported + every reason not to, and "
-    "rows\n"
-    "stored = 2 x reported (1 for an object without a name) + counts + 1. Exit status 1 where "
-    "they\n"
-    "do not, where the last run failed, and where the spool is damaged.\n\n"
+    "status", "Say whether this machine reports, and whether all is well",
+    "Exit status 0 if there is no problem, 1 if there is one, 4 if this user may not look.\n"
+    "Notes do not change it. tesselctl(1) lists the problems.\n\n"
     "Example: warn from a cron job\n"
     "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root"};
 

@@ -1,13 +1,17 @@
 // Gathering what the service left on this machine.
 //
-// A question for the status must not delay a run, so nothing here takes the lock of a run. The
-// price: if a run ends while we look, the facts may come from two moments.
+// A question for the status must not delay a run, so nothing here holds the lock of a run for
+// longer than an instant. The price: if a run ends while we look, the facts may come from two
+// moments.
 
 #include "tesselctl/judging/ReporterStatus.h"
 
 #include <pwd.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <filesystem>
 #include <memory>
@@ -16,17 +20,23 @@
 #include "linux/RunRecordFile.h"
 #include "linux/Scheduler.h"
 #include "linux/StateDirectory.h"
+#include "linux/SystemFacts.h"
+#include "os/Files.h"
 #include "service/ReportingRun.h"
+#include "tesselctl/judging/ServiceUser.h"
 #include "trace/TracePointTable.h"
 
 namespace tessel::ctl {
 
 namespace {
 
-// The unit binds this directory over /var/tmp. Only the service's user and root may look into it.
+// What the package installs. The unit binds the last directory over /var/tmp. Only the service's
+// user and root may look into it.
+constexpr char kPackageStateDirectory[] = "/var/lib/tessel";
+constexpr char kTimer[] = "tessel-reporter.timer";
 constexpr char kUnitMarkerDirectory[] = "/var/lib/tessel-marker";
 
-Marker lookForMarker(MarkerOf of, std::string path) {
+Marker lookForMarker(MarkerOf of, std::string path, uid_t service) {
   struct stat facts {};
   Marker marker;
   marker.of = of;
@@ -38,6 +48,7 @@ Marker lookForMarker(MarkerOf of, std::string path) {
     return marker;
   }
   marker.state = Marker::State::present;
+  marker.ofService = facts.st_uid == service;
   marker.since = Date{std::chrono::seconds{facts.st_mtim.tv_sec}};
   // The user may be gone: a number still tells who made the marker.
   const passwd* user = ::getpwuid(facts.st_uid);
@@ -45,16 +56,16 @@ Marker lookForMarker(MarkerOf of, std::string path) {
   return marker;
 }
 
-std::vector<Marker> lookForMarkers() {
+std::vector<Marker> lookForMarkers(uid_t service) {
   std::vector<Marker> markers;
   // The package makes the directory, and the unit does not start without it. So a machine without
   // the directory has no run under the unit.
   struct stat facts {};
   if (::lstat(kUnitMarkerDirectory, &facts) == 0) {
     const std::string name = std::filesystem::path(cookieFilePath).filename();
-    markers.push_back(lookForMarker(MarkerOf::unit, kUnitMarkerDirectory + ("/" + name)));
+    markers.push_back(lookForMarker(MarkerOf::unit, kUnitMarkerDirectory + ("/" + name), service));
   }
-  markers.push_back(lookForMarker(MarkerOf::runByHand, cookieFilePath));
+  markers.push_back(lookForMarker(MarkerOf::runByHand, cookieFilePath, service));
   return markers;
 }
 
@@ -77,12 +88,101 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
   return facts;
 }
 
-std::optional<std::string> deferralNow(const LaunchConfiguration& launch,
-                                       const StateDirectory& state) {
+void lookAtDeferral(ReporterStatus& status, const LaunchConfiguration& launch,
+                    const StateDirectory& state) {
   const DeferralConditions conditions(launch.deferOn, state.deferFile());
   for (const DeferReason reason : {conditions.byFile(), conditions.byMachine()}) {
-    if (reason != DeferReason::none) return conditions.words(reason);
+    if (reason == DeferReason::none) continue;
+    status.deferral = conditions.words(reason);
+    // The scheduler notes how long the machine has put the run off, in all.
+    status.deferredSince =
+        reason == DeferReason::file ? fileTime(state.deferFile()) : status.now - state.putOff();
+    return;
   }
+}
+
+void lookAtRuns(ReporterStatus& status, const StateDirectory& state) {
+  auto read = readRunHistory(state.path());
+  if (auto* history = std::get_if<RunHistory>(&read)) {
+    status.runs = std::move(history->runs);
+    status.run = std::move(history->last);
+  } else {
+    status.recordFailure = std::get<PlatformError>(std::move(read));
+  }
+  status.recordWritten = fileTime(runRecordPath(state.path()));
+  status.underWay = state.isLocked();
+  status.refusedFiles = state.refusedFiles();
+  status.lastBegin = state.lastRun();
+}
+
+void lookAtSpool(ReporterStatus& status, const LaunchConfiguration& launch) {
+  SpoolReader spool(launch.stateDirectory);
+  status.spoolState = spool.open();
+  if (status.spoolState == SpoolReader::State::open) {
+    // A database may open well and fail at the first query.
+    const auto contents = spool.contents();
+    if (!contents) status.spoolState = SpoolReader::State::damaged;
+    status.spool = contents.value_or(SpoolContents{});
+  }
+  status.spoolFailure = spool.reason();
+  // The service may have other settings than this shell, so what it noted comes first.
+  status.spoolLimitBytes = status.spool.limit.value_or(0);
+  if (status.spoolLimitBytes == 0) status.spoolLimitBytes = launch.spoolLimitBytes;
+}
+
+// What stands in the way of replacing a file, though the directory may be changed.
+std::optional<std::string> obstacle(const std::string& directory) {
+  const std::string record = runRecordPath(directory);
+  for (const std::string& path : {record, record + ".new"}) {
+    struct stat facts {};
+    if (::lstat(path.c_str(), &facts) == 0 && S_ISDIR(facts.st_mode))
+      return path + " is a directory";
+  }
+  struct statvfs room {};
+  if (::statvfs(directory.c_str(), &room) == 0 && room.f_blocks != 0 && room.f_bavail == 0)
+    return directory + ": no space is left";
+  return {};
+}
+
+ServiceAccess accessOfService(const LaunchConfiguration& launch, const std::string& taskingFile,
+                              uid_t user) {
+  ServiceAccess access;
+  const auto tasking = tryToRead(user, taskingFile);
+  access.taskingKnown = tasking.has_value();
+  if (tasking && *tasking != 0 && codeOf(*tasking) != ErrorCode::notFound)
+    access.taskingRefused = fileError(taskingFile, *tasking).words;
+  struct stat facts {};
+  // Without a directory nothing is wrong yet: the first run makes it.
+  if (::stat(launch.stateDirectory.c_str(), &facts) != 0) {
+    access.recordKnown = errno == ENOENT;
+    return access;
+  }
+  const auto change = tryToChange(user, launch.stateDirectory);
+  access.recordKnown = change.has_value();
+  if (change && *change != 0)
+    access.recordRefused = fileError(launch.stateDirectory, *change).words;
+  if (!access.recordRefused) access.recordRefused = obstacle(launch.stateDirectory);
+  return access;
+}
+
+// A file that we may not reach looks like a file that is absent. Without this a machine that nobody
+// may look at would seem to be one that never ran.
+std::optional<std::string> refusalOf(const std::string& directory) {
+  if (::access(directory.c_str(), R_OK | X_OK) == 0 || errno != EACCES) return {};
+  return fileError("state directory " + directory, EACCES).words;
+}
+
+NextRun nextRunOf(const ReporterStatus& status, const LaunchConfiguration& launch) {
+  if (status.underWay) return {NextRun::By::underWay, {}};
+  const auto interval =
+      status.run && status.run->interval ? status.run->interval : launch.activityInterval;
+  if (interval) {
+    const Date due = status.lastBegin ? *status.lastBegin + *interval : status.now;
+    return {NextRun::By::interval, std::max(due, status.now)};
+  }
+  // The timer of the package starts runs on the state directory of the package.
+  if (!status.ofPackage) return {};
+  if (const auto at = nextElapseOf(kTimer)) return {NextRun::By::timer, *at};
   return {};
 }
 
@@ -102,26 +202,31 @@ std::string_view markerStateName(Marker::State state) {
   return "cannot_be_seen";
 }
 
+std::string_view nextRunName(NextRun::By by) {
+  // In the order of NextRun::By, which indexes them.
+  static constexpr std::string_view kNames[] = {"nothing", "timer", "interval", "under_way"};
+  return kNames[static_cast<size_t>(by)];
+}
+
 ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   const StateDirectory state = StateDirectory::forReading(launch.stateDirectory);
+  const uid_t service = serviceUser(launch.stateDirectory);
   ReporterStatus status;
   status.now = now;
+  status.boot = thisBoot();
+  status.stateDirectory = launch.stateDirectory;
+  status.ofPackage = launch.stateDirectory == kPackageStateDirectory;
+  status.stateRefused = refusalOf(launch.stateDirectory);
   status.tasking = askTasking(launch);
   status.taskingWords = taskingWords(status.tasking, launch);
-  status.deferral = deferralNow(launch, state);
-  status.markers = lookForMarkers();
-  status.run = readRunRecord(launch.stateDirectory);
-  status.refusedFiles = state.refusedFiles();
-  status.lastBegin = state.lastRun();
-  SpoolReader spool(launch.stateDirectory);
-  status.spoolState = spool.open();
-  if (status.spoolState == SpoolReader::State::open) {
-    // A database may open well and fail at the first query.
-    const auto contents = spool.contents();
-    if (!contents) status.spoolState = SpoolReader::State::damaged;
-    status.spool = contents.value_or(SpoolContents{});
-  }
-  status.spoolFailure = spool.reason();
+  const bool internal = status.tasking.decision.source() == TaskingSource::internalBuild;
+  status.taskingWritten = fileTime(internal ? launch.osReleasePath : status.tasking.file);
+  status.service = accessOfService(launch, status.tasking.file, service);
+  lookAtDeferral(status, launch, state);
+  status.markers = lookForMarkers(service);
+  lookAtRuns(status, state);
+  lookAtSpool(status, launch);
+  status.nextRun = nextRunOf(status, launch);
   status.store = launch.traceStore;
   status.journal = lookAtJournal(launch.traceStore);
   judge(status);

@@ -13,6 +13,7 @@
 
 #include "linux/Findings.h"
 #include "linux/LaunchConfiguration.h"
+#include "linux/SystemFacts.h"
 #include "objects/RunRecord.h"
 #include "platform/Error.h"
 #include "tesselctl/judging/Tasking.h"
@@ -33,8 +34,10 @@ struct Marker {
   MarkerOf of = MarkerOf::runByHand;
   std::string path;  // of the file, there or not
   State state = State::absent;
-  std::string owner;  // if present
-  Date since{};       // if present
+  // If present:
+  std::string owner;
+  bool ofService = false;  // made by the service's user
+  Date since{};
 
   bool present() const { return state == State::present; }
 };
@@ -46,23 +49,53 @@ struct JournalFacts {
   std::optional<PlatformError> failure;  // absent where it can be read
 };
 
+// When the next run begins, and what starts it.
+struct NextRun {
+  enum class By { nothing, timer, interval, underWay };
+
+  By by = By::nothing;     // nothing: nobody knows what starts it
+  std::optional<Date> at;  // absent where nobody knows
+};
+// Names for JSON: "nothing", "timer", "interval", "under_way".
+std::string_view nextRunName(NextRun::By by);
+
+// How the service's user stands to what it must read and write.
+struct ServiceAccess {
+  std::optional<std::string> taskingRefused;  // why it cannot read the tasking file
+  std::optional<std::string> recordRefused;   // why it cannot write the record
+  bool taskingKnown = false;                  // whether this user could find out
+  bool recordKnown = false;
+};
+
 struct ReporterStatus {
   Date now{};
+  Boot boot;
+  std::string stateDirectory;
+  bool ofPackage = false;                   // it is the one that the package's unit uses
+  std::optional<std::string> stateRefused;  // why this user may not look into it
   Tasking tasking;
   std::string taskingWords;
+  std::optional<Date> taskingWritten;  // when the file was written that decides
+  ServiceAccess service;
   std::optional<std::string> deferral;  // why one is wanted
+  std::optional<Date> deferredSince;    // since when the machine or the defer file wants one
   // The unit's first, if this machine has its directory; then that of a run by hand.
   std::vector<Marker> markers;
+  std::vector<RunNote> runs;  // the last ones, oldest first
   std::optional<RunRecord> run;
-  std::vector<PlatformError> refusedFiles;  // of the state directory, each with the reason
+  std::optional<PlatformError> recordFailure;  // why the record is not used
+  std::optional<Date> recordWritten;           // when its file was written
+  bool underWay = false;                       // somebody holds the right to run
+  std::vector<PlatformError> refusedFiles;     // of the state directory, each with the reason
   // The begin of the last run that came to its end and was not deferred. The scheduler notes it.
   std::optional<Date> lastBegin;
+  NextRun nextRun;
   SpoolReader::State spoolState = SpoolReader::State::absent;
   std::string spoolFailure;
   SpoolContents spool;
+  uint64_t spoolLimitBytes = 0;
   std::optional<std::string> store;  // absent: the machine's own journal
   JournalFacts journal;
-
   // What is wrong and what is worth knowing, in the order of the codes: problems first.
   std::vector<Finding> findings;
   std::vector<FindingCode> checked;  // the problems that were looked for
@@ -74,9 +107,21 @@ struct ReporterStatus {
   bool keepsADay() const {
     return journal.oldest && *journal.oldest <= now - std::chrono::hours{24};
   }
-  // Whether a later run than the recorded one came to its end. It was not tasked, or its record
-  // could not be written. A run that dies leaves no note, so it does not show here.
-  bool runWithoutRecord() const { return lastBegin && (!run || *lastBegin > run->end); }
+  // How full the spool is, without rows that were delivered: they give way to new ones. Rounded up,
+  // so that a spool with rows in it does not seem to be empty.
+  uint64_t spoolPercent() const {
+    return spool.bytesOfWaiting == 0 ? 0 : spool.bytesOfWaiting / (spoolLimitBytes / 100 + 1) + 1;
+  }
+  // Whether the last run that began has no end, and is not under way.
+  bool lastRunDied() const { return !underWay && !runs.empty() && !runs.back().end; }
+  // Whether a later run than the noted ones came to its end: it was not tasked, or nothing could be
+  // written. A record that was written since that run began says that the run did write.
+  bool runWithoutNote() const {
+    if (!lastBegin) return false;
+    if (recordFailure) return true;
+    return (runs.empty() || *lastBegin > runs.back().start) &&
+           (!recordWritten || *recordWritten < *lastBegin);
+  }
 };
 
 // Fills `findings` and `checked` from the facts.

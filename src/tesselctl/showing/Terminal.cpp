@@ -290,8 +290,8 @@ std::string wrapped(std::string_view text, size_t width, size_t indent) {
   return wrappedBehind(0, text, width, indent);
 }
 
-std::string wrappedBeside(std::string_view text, size_t width, size_t indent) {
-  return wrappedBehind(indent, text, std::max(width, indent + 12), indent);
+std::string wrappedBeside(std::string_view text, size_t width, size_t indent, size_t beyond) {
+  return wrappedBehind(indent + beyond, text, std::max(width, indent + 12), indent);
 }
 
 // A shell may start us with a standard descriptor closed (`>&-`). The next file that we open would

@@ -93,8 +93,9 @@ class Table {
 // A word that is longer than a line stands alone and loses its middle.
 std::string wrapped(std::string_view text, size_t width, size_t indent);
 // The same beside a label of `indent` columns, which the caller writes before the first line. On a
-// terminal too narrow for that, lines are 12 columns wide behind the label.
-std::string wrappedBeside(std::string_view text, size_t width, size_t indent);
+// terminal too narrow for that, lines are 12 columns wide behind the label. A label that is longer
+// reaches `beyond` columns further on the first line.
+std::string wrappedBeside(std::string_view text, size_t width, size_t indent, size_t beyond = 0);
 
 // One JSON object on a line of its own. `write(JsonWriter&)` writes its members.
 template <typename Write>

@@ -1,0 +1,154 @@
+#!/usr/bin/env python3
+"""Problems of `tesselctl status` that the machine and the spool have: each appears, and goes once all is well."""
+import json
+import os
+import signal
+import subprocess
+import time
+
+import harness
+from harness import BIN, wait_for
+from otlp_receiver import Answer, Receiver
+from status_case import NOBODY, STRANGER, StatusTest, up_for
+
+
+class Machine(StatusTest):
+    def test_a_marker_that_is_not_the_services_own(self):
+        self.service()
+        marker = os.path.join(self.machine.var_tmp, harness.MARKER)
+        open(marker, "w", encoding="utf-8").close()
+        self.assertEqual(self.problems(), {}, "one of a run that died, and the next run removes it")
+        os.chown(marker, STRANGER, STRANGER)
+        self.assertEqual(self.problems(), {"marker_stuck": None})
+        self.assertEqual(self.problem("marker_stuck")["command"], f"rm -rf /var/tmp/{harness.MARKER}")
+        os.chown(marker, 0, 0)
+        self.change_record(lambda record: record.update(marker="still there"))
+        self.assertEqual(self.problems(), {"marker_stuck": None})
+        os.unlink(marker)
+        self.assertEqual(self.problems(), {})
+
+    def test_a_strangers_marker_beside_the_units_runs(self):
+        for name in ("tessel", "tessel-marker"):
+            os.mkdir(os.path.join(self.machine.var_lib, name))
+        marker = os.path.join(self.machine.var_tmp, harness.MARKER)
+        open(marker, "w", encoding="utf-8").close()
+        os.chown(marker, STRANGER, STRANGER)
+        self.assertEqual(self.problems(TESSEL_STATE_DIR=None), {}, "any user can put one there, and it stops no run")
+        os.rename(marker, os.path.join(self.machine.var_lib, "tessel-marker", harness.MARKER))
+        self.assertEqual(self.problems(TESSEL_STATE_DIR=None), {"marker_stuck": None})
+
+    def test_a_deferral_of_a_day(self):
+        self.service()
+        self.machine.ctl("defer", "on")
+        self.age(self.state("defer"), 0.9)
+        self.assertEqual(self.problems(), {})
+        self.age(self.state("defer"), 1.1)
+        self.assertEqual(self.problems(), {"deferred": None})
+        self.assertEqual(self.problems(TESSEL_DEFER_ON=""), {}, "it defers nothing")
+        self.age(self.state("defer"), -5)
+        self.assertEqual(self.problems(), {}, "the clock was set")
+        self.age(self.state("defer"), 5)
+        self.machine.ctl("defer", "off")
+        self.assertEqual(self.problems(), {})
+
+    def test_a_state_directory_that_cannot_be_written(self):
+        self.service()
+        self.machine.read_only = [self.machine.state]
+        self.assertEqual(self.problems(), {"record_unwritable": None})
+        self.machine.read_only = []
+        self.assertEqual(self.problems(), {})
+        os.unlink(self.state("last_run.json"))
+        os.mkdir(self.state("last_run.json"))
+        self.assertIn("record_unwritable", self.problems())
+        os.rmdir(self.state("last_run.json"))
+        self.service()
+        self.assertEqual(self.problems(), {})
+
+    def test_root_and_the_services_user_see_the_same(self):
+        for folder in (self.machine.root, self.machine.store, self.machine.config):
+            os.chmod(folder, 0o755)
+        os.chmod(self.tasking_file(), 0o600)
+        os.chown(self.machine.state, 65534, 65534)
+        self.assertEqual(self.problems(), {"tasking_unreadable": None})
+        self.assertEqual(self.problems(before=NOBODY), {"tasking_unreadable": None})
+        os.chmod(self.tasking_file(), 0o644)
+        self.assertEqual((self.problems(), self.problems(before=NOBODY)), ({}, {}))
+        os.chmod(self.machine.state, 0o500)
+        self.assertEqual((self.problems(), self.problems(before=NOBODY)), ({"record_unwritable": None},) * 2)
+
+    def test_another_user_is_told_that_he_may_not_look(self):
+        self.service()
+        for folder, mode in ((self.machine.root, 0o755), (self.machine.state, 0o700)):
+            os.chmod(folder, mode)
+        result = self.call("tesselctl", "status", "--json", before=NOBODY)
+        status = json.loads(result.out)
+        self.assertEqual((result.status, status["good"], [found["code"] for found in status["problems"]]),
+                         (4, False, ["no_access"]))
+        self.assertNotIn("no_completed_run", status["checked"])
+
+    def test_without_a_state_directory(self):
+        os.rmdir(self.machine.state)
+        self.assertEqual(self.problems(), {})
+        self.assertEqual(self.status()["spool"]["state"], "absent")
+        self.assertFalse(os.path.exists(self.machine.state))
+
+
+class Spool(StatusTest):
+    def test_a_spool_that_fills(self):
+        self.service(TESSEL_SPOOL_LIMIT=str(4 << 20))
+        self.fill_spool(0.75)
+        self.assertEqual(self.problems(), {})
+        self.fill_spool(0.1)
+        self.assertEqual(self.problems(), {"spool_filling": None}, "though this shell has the default limit")
+        self.assertRegex(self.call("tesselctl", "status").out, r"Spool +\d+ rows +.* 8\d % of its limit")
+        self.spool("DELETE FROM events WHERE id % 2")
+        self.assertEqual(self.problems(), {})
+
+    def test_a_damaged_spool_until_a_run_began_a_new_one(self):
+        self.service()
+        with open(self.state("statora.db"), "r+b") as file:
+            file.write(os.urandom(4096))
+        self.assertEqual(self.problems(), {"spool_damaged": None})
+        self.service()
+        status = self.status()
+        self.assertEqual((status["problems"], [note["code"] for note in status["notes"]]), ([], ["spool_set_aside"]))
+        self.service()
+        self.assertEqual(self.status()["notes"], [])
+
+    def test_a_forwarder_that_delivers_nothing(self):
+        self.service()
+        late = lambda: self.spool("UPDATE events SET time = time - ?", int(3 * 3600 * 1e6))
+        late()
+        self.assertEqual(self.problems(), {}, "there is no forwarder")
+        self.forward(Answer(401, b"who are you?"))
+        self.assertEqual(self.problems(), {"forwarder_stuck": None})
+        self.assertEqual(self.problems(before=up_for(60)), {}, "a machine that was off could not deliver")
+        self.assertRegex(self.problem("forwarder_stuck")["words"], r"nothing for 3.h, .*events wait; the last error, \d+.s ago: 401: who are you\?$")
+        self.spool("INSERT OR REPLACE INTO forwarder VALUES('ordered_until', ?)", int((time.time() + 60) * 1e6))
+        self.assertEqual(self.problems(), {}, "the collector asked for this wait")
+        self.spool("UPDATE forwarder SET value = 1 WHERE name = 'ordered_until'")
+        self.fill_spool(0.9)
+        self.spool("UPDATE meta SET value = ? WHERE key = 'limit_bytes'", str(4 << 20))
+        self.assertEqual(self.problems(), {"forwarder_stuck": None, "spool_filling": "forwarder_stuck"})
+        self.forward(Answer())
+        self.assertEqual(self.problems(), {})
+        self.service()
+        self.assertEqual(self.problems(), {}, "rows of this moment wait")
+
+    def test_a_wait_that_the_collector_orders_is_noted(self):
+        self.service()
+        with Receiver(lambda request, number: Answer(503, headers={"Retry-After": "600"})) as receiver:
+            process = subprocess.Popen([os.path.join(BIN, "statora_forwarder"), "--once"], stderr=subprocess.DEVNULL,
+                                       env=self.machine.environment(OTEL_EXPORTER_OTLP_ENDPOINT=receiver.url))
+            noted = lambda: dict(self.spool("SELECT name, value FROM forwarder")) if self.spool(
+                "SELECT 1 FROM sqlite_schema WHERE name = 'forwarder'") else {}
+            wait_for(lambda: noted().get("ordered_until"))
+            process.send_signal(signal.SIGTERM)
+            process.wait()
+        forwarder = self.status()["forwarder"]
+        self.assertGreaterEqual(forwarder["ordered_until"] - forwarder["last_error_at"], 600e6)
+        self.assertIn("503", forwarder["last_error"])
+
+
+if __name__ == "__main__":
+    harness.main()
