@@ -94,6 +94,8 @@ class Events(CtlTest):
         self.assertEqual(names("--subsystem", "com.vantor.B", "--name", "*.tessel"), ["com.vantor.performance.tessel"])
         self.assertEqual(names("--category", "x", "--name", "ts__*"), ["ts__com.vantor.A__x__One"])
         self.assertEqual(names("-n", "2"), rows[-2:])
+        for count in ("0", "-1", "x"):
+            self.assertEqual(self.machine.ctl("events", "-n", count).status, 2)
         self.assertEqual(names("--last", "1h"), rows)
         self.assertEqual(names("--until", "-1h"), [])
 

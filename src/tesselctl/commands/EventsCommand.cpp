@@ -212,6 +212,13 @@ int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
   return EventsRun(options, period, surroundings).list();
 }
 
+// Zero would mean all rows, and a negative number a great many.
+std::string whyNoCount(const std::string& text) {
+  const bool digits = text.find_first_not_of("0123456789") == std::string::npos;
+  if (digits && text.find_first_not_of('0') != std::string::npos) return {};
+  return "'" + text + "' is no number of rows; the least is 1";
+}
+
 const CommandText kEvents{
     "events", "Show what the spool holds, newest last",
     "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event that\n"
@@ -243,7 +250,9 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
               "Only payloads of this subsystem; may be repeated");
   addPatterns(command, "--category", options.categories,
               "Only payloads of this category; may be repeated");
-  command.add_option("-n,--newest", options.newest, "Only so many, the newest")->type_name("COUNT");
+  command.add_option("-n,--newest", options.newest, "Only so many, the newest")
+      ->check(whyNoCount)
+      ->type_name("COUNT");
   auto* const sent = command.add_flag(
       "--sent", options.sent,
       "Only what was delivered; --since, --until and --last then mean the time of delivery");

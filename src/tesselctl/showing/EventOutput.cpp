@@ -89,7 +89,7 @@ std::string laidOut(std::string_view json) {
   return out;
 }
 
-Date dateOf(int64_t microseconds) { return Date{std::chrono::microseconds{microseconds}}; }
+Date dateOf(int64_t time) { return Date{std::chrono::microseconds{time}}; }
 
 // A record that the forwarder itself has made has no id.
 std::string idText(const SpooledEvent& event) {
