@@ -280,9 +280,44 @@ class Conformance(unittest.TestCase):
                              ["the subsystem is missing", "TESSEL_NAME has 4097 bytes, the limit is 4096"])
             self.assertRegex(told[0], r"^tessel: (runner|main)\.\w+:\d+: ")
         self.assertEqual(len(journal(check.pid)), 1)
+        if language in ("c", "cpp", "go"):
+            dropped = Runner(language, TESSEL_TRACE="check")
+            self.assertEqual(dropped.record(point(n1=("i", None, 5)), "v"), 0)
+            told = dropped.close()[1]
+            self.assertEqual([text.partition(": ")[2].partition(": ")[2] for text in told],
+                             ["dropped: number1 has a value and no label"])
         absent = Runner(language, TESSEL_JOURNAL_SOCKET="/nowhere")
         self.assertIn(absent.record(point(), "v"), (errno.ENOENT, None))
         self.assertEqual(absent.close()[0], 0 if language != "shell" else 4)
+
+    def test_closed_standard_streams(self):
+        self.each(self.check_streams, RUNNERS)
+
+    def check_streams(self, language):
+        """The socket takes none of their numbers: what the program writes there would go to the journal."""
+        closed = subprocess.Popen(["sh", "-c", 'exec "$@" 2>&-', "sh", *RUNNERS[language]], env=CLEAN, text=True,
+                                  stdin=subprocess.PIPE, stdout=subprocess.PIPE)
+        closed.stdin.write(line(point(), "v") + "\n")
+        closed.stdin.flush()
+        self.assertEqual(closed.stdout.readline(), "0\n")
+        descriptors = f"/proc/{closed.pid}/fd"
+        sockets = {fd for fd in os.listdir(descriptors) if os.readlink(f"{descriptors}/{fd}").startswith("socket:")}
+        closed.communicate(timeout=60)
+        self.assertTrue(sockets and not sockets & {"0", "1", "2"}, sockets)
+
+    def test_an_interrupted_wait(self):
+        """A signal handler of Python may raise while a call waits. The point of that call is lost."""
+        program = ("import signal, tessel\n"
+                   "signal.signal(signal.SIGALRM, signal.default_int_handler)\n"
+                   "while tessel.event('s', 'c', no_wait=True) == 0: pass\n"
+                   "signal.setitimer(signal.ITIMER_REAL, 0.3)\n"
+                   "try: tessel.event('s', 'c')\n"
+                   "except KeyboardInterrupt: print(tessel.lost(), flush=True)\n"
+                   "import os; os._exit(0)\n")
+        result = self.stopped_daemon(lambda: subprocess.run(
+            ["/usr/bin/python3", "-c", program], env={**CLEAN, "TESSEL_TRACE_WAIT": "1000"}, capture_output=True,
+            text=True, check=False, timeout=60))
+        self.assertEqual((result.stdout, result.stderr), ("2\n", ""))
 
     def check_ids(self, entries):
         """A begin and its end have one id, and no other interval of the process has it."""
@@ -291,6 +326,20 @@ class Conformance(unittest.TestCase):
         self.assertEqual([kind for kind, _ in ids][:5], [b"end", b"begin", b"begin", b"end", b"end"])
         self.assertEqual((ids[1][1], ids[2][1]), (ids[3][1], ids[4][1]))
         self.assertNotEqual(ids[1][1], ids[2][1])
+
+class PythonAlone(unittest.TestCase):
+    def test_mistakes_that_only_python_allows(self):
+        program = ("import fractions, sys, tessel\n"
+                   "print(tessel.event('s', 'c', number1=('n', fractions.Fraction(10 ** 400))))\n"
+                   "sys.stderr = None\n"
+                   "print(tessel.event('', 'c'))\n"
+                   "try: tessel.interval('s', 'c').nubmer1 = ('n', 1)\n"
+                   "except AttributeError: print('misspelt')\n")
+        result = subprocess.run(["/usr/bin/python3", "-c", program], capture_output=True, text=True, check=False,
+                                env={**CLEAN, "TESSEL_TRACE": "check", "TESSEL_JOURNAL_SOCKET": "/nowhere"})
+        self.assertEqual(result.stdout.split(), [str(errno.EDOM), str(errno.EINVAL), "misspelt"])
+        self.assertRegex(result.stderr, r"^tessel: <string>:2: refused: number1 is not finite\n$")
+
 
 class Examples(unittest.TestCase):
     def setUp(self):

@@ -125,6 +125,9 @@ class CommandLine(unittest.TestCase):
             around = ctl("record", "--subsystem", "s", "--category", "c", *where, "--", "sh", "-c", "exit 3", env=off)
             lines = ctl("record", "--stdin", *where, env=off, input="nonsense\n")
             self.assertEqual((around.returncode, lines.returncode, lines.stderr, os.listdir(store)), (3, 0, "", []))
+            absent = {**os.environ, "TESSEL_JOURNAL_SOCKET": "/nowhere"}
+            around = ctl("record", "--subsystem", "s", "--category", "c", "--", "sh", "-c", "exit 3", env=absent)
+            self.assertEqual((around.returncode, around.stderr.count("no journal is running")), (3, 1))
             ctl("record", "event", "s", "c", *where)
             ctl("record", "event", "s", "c", "--message", "asked for", "--field", "PRIORITY=5", *where)
             with open(os.path.join(store, "tessel.export"), encoding="utf-8") as file:

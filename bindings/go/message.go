@@ -85,6 +85,9 @@ func (m *message) putString(slot string, value String) {
 
 func (m *message) putNumber(slot string, value Number) {
 	if value.label == "" {
+		if value.text != "" {
+			say("dropped", slot+" has a value and no label", "")
+		}
 		return
 	}
 	if !value.finite {

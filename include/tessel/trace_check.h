@@ -141,6 +141,14 @@ TESSEL_SLOW_ void tessel_check_texts_(tessel_place_ place, const tessel_point* p
   }
 }
 
+/* A number counts as absent without a label. tessel_int(NULL, 0) looks like one that was never set.
+ */
+TESSEL_SLOW_ void tessel_check_number_(tessel_place_ place, const tessel_number* number,
+                                       const char* words) {
+  const bool set = number->kind != TESSEL_NUMBER_SIGNED || number->value.as_unsigned != 0;
+  if (!number->label && set) tessel_tell_(place, "dropped", words);
+}
+
 /* Tells what became of a point. `error` is what its call answers. */
 TESSEL_SLOW_ void tessel_check_(tessel_place_ place, const tessel_point* point, bool is_event,
                                 const tessel_message_* message, int error) {
@@ -159,6 +167,8 @@ TESSEL_SLOW_ void tessel_check_(tessel_place_ place, const tessel_point* point, 
     tessel_tell_(place, "dropped", "an event has no interval_id");
   }
   if (is_event && point->system_scope) tessel_tell_(place, "dropped", "an event has no scope");
+  tessel_check_number_(place, &point->number1, "number1 has a value and no label");
+  tessel_check_number_(place, &point->number2, "number2 has a value and no label");
   tessel_check_texts_(place, point);
 }
 

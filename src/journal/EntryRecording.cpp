@@ -228,4 +228,6 @@ std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fie
   return std::nullopt;
 }
 
+void countAsLost() { tessel_count_lost_(); }
+
 }  // namespace tessel

@@ -57,4 +57,7 @@ bool recordingEnabled();
 // error if there is no daemon; the system's own library would return success.
 std::optional<PlatformError> sendToJournal(const std::vector<RecordedField>& fields);
 
+// Counts a trace point as lost that was never handed over: the end of an interval whose begin was.
+void countAsLost();
+
 }  // namespace tessel

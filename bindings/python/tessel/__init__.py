@@ -43,6 +43,7 @@ TESSEL_TRACE in the environment, read by the first call: 0 records nothing; `che
 losses on standard error, once for each place in the source. Any thread may call any function.
 """
 
+import copy
 import errno
 import numbers
 import struct
@@ -91,7 +92,10 @@ def _decimal(name: str, value: Any, words: str = "") -> bytes:
         return field(name, b"%d" % value)
     if not isinstance(value, numbers.Real) or isinstance(value, bool):
         raise Refused(errno.EDOM, f"{words} is a {type(value).__name__}, neither int nor float")
-    value = float(value)
+    try:
+        value = float(value)
+    except OverflowError:  # a fraction
+        value = float("inf")
     if value != value or value in (float("inf"), float("-inf")):
         raise Refused(errno.EDOM, f"{words} is not finite")
     text = b"%.15g" % value
@@ -151,7 +155,10 @@ def _frame_rate(rate: Any) -> bytes:
 
 
 class _Point:
-    """What a trace point says."""
+    """What a trace point says. Slots: to set one that does not exist, misspelt, is an error."""
+
+    __slots__ = ("subsystem", "category", "name", "string1", "string2", "number1", "number2", "attributes",
+                 "interval_id", "system_scope", "telemetry", "no_wait", "_error", "_open", "_lost", "_start", "_own_id")
 
     def __init__(self, subsystem: str, category: str, name: Optional[str] = None, *,
                  string1: Optional[String] = None, string2: Optional[String] = None,
@@ -170,6 +177,12 @@ class _Point:
         self.system_scope = system_scope
         self.telemetry = telemetry
         self.no_wait = no_wait
+        # Of an interval alone.
+        self._error = 0  # of the begin; what the end answers while the interval is not open
+        self._open = False
+        self._lost = False  # the begin, and the end was not counted yet
+        self._start = 0
+        self._own_id = b""
 
     def encoded(self, kind: str) -> bytes:
         if self.subsystem is None or self.subsystem == "":
@@ -204,11 +217,7 @@ class Interval(_Point):
     in many threads: each call is an interval of its own, and so is each call of an `async def`.
     """
 
-    _error = 0  # of the begin; what the end answers while the interval is not open
-    _open = False
-    _lost = False  # the begin, and the end was not counted yet
-    _start = 0
-    _own_id = b""
+    __slots__ = ()
 
     def begin(self) -> int:
         """Begins the interval; called again, begins another."""
@@ -254,9 +263,10 @@ class Interval(_Point):
             self.end()
 
     def _another(self) -> "Interval":
-        copy = Interval.__new__(type(self))
-        copy.__dict__.update(self.__dict__, _open=False, _lost=False, _error=0)
-        return copy
+        another = copy.copy(self)
+        another._open = another._lost = False
+        another._error = 0
+        return another
 
     def __call__(self, function: _Function) -> _Function:
         import functools

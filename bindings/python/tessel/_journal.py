@@ -86,6 +86,7 @@ class Recorder:
         self._socket: Optional[socket.socket] = None
         self._inode = 0
         self._intervals = 0
+        self._taken = 0  # points that the socket took; threads may miss one of another, which does no harm
         self._stuck = 0  # when the last wait began that ended without room, in monotonic ns; 0: none
         self.lost = 0
         self._since = 0  # microseconds since 1970 of the first loss
@@ -155,10 +156,12 @@ class Recorder:
             if told in self._told_places:
                 return
             self._told_places.add(told)
+        if sys.stderr is None:
+            return
         try:
             print(f"tessel: {os.path.basename(file)}:{line}: {effect}: {words}", file=sys.stderr)
-        except (OSError, ValueError):
-            pass  # nobody to tell
+        except (OSError, ValueError, RuntimeError):
+            pass  # nobody to tell, or a signal handler came while another line was printed
 
     # --- Losses and forks.
 
@@ -193,8 +196,13 @@ class Recorder:
     def _deliver(self, message: bytes, no_wait: bool) -> int:
         error = self._offer(message)
         if error == errno.EAGAIN and not no_wait:
-            error = self._wait(message)
+            try:
+                error = self._wait(message)
+            except BaseException:  # of a signal handler, as Ctrl-C raises it: nobody tries this point again
+                self.count_lost()
+                raise
         if error == 0:
+            self._taken += 1
             self._stuck = 0
         return error
 
@@ -217,7 +225,7 @@ class Recorder:
         """Waits for room. After a wait that ended without any, the daemon takes nothing, and programs must
         not stand still for it. Who takes the time that was earned since sets its beginning anew, so it
         is taken once however many threads record."""
-        now = time.monotonic_ns()
+        now, taken = time.monotonic_ns(), self._taken
         with self._lock:
             limit = min(self._wait_ns, (now - self._stuck) // WAIT_SHARE) if self._stuck else self._wait_ns
             if limit < 1_000_000:
@@ -225,7 +233,7 @@ class Recorder:
             if self._stuck:
                 self._stuck = now
         error = self._offer_within(message, limit)
-        if error == errno.EAGAIN:
+        if error == errno.EAGAIN and taken == self._taken:  # no other thread was quicker each time
             self._stuck = now
         return error
 

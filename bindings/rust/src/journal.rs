@@ -14,8 +14,9 @@ use std::os::unix::fs::{FileTypeExt, MetadataExt};
 use std::os::unix::io::{AsRawFd, FromRawFd, IntoRawFd};
 use std::os::unix::net::UnixDatagram;
 use std::panic::Location;
-use std::sync::atomic::{AtomicI32, AtomicU32, AtomicU64, Ordering::AcqRel, Ordering::Acquire, Ordering::Relaxed};
-use std::sync::{Mutex, Once};
+use std::sync::atomic::{AtomicBool, AtomicI32, AtomicU32, AtomicU64};
+use std::sync::atomic::{Ordering::AcqRel, Ordering::Acquire, Ordering::Relaxed};
+use std::sync::Mutex;
 use std::time::{SystemTime, UNIX_EPOCH};
 
 const SOCKET: &str = "/run/systemd/journal/socket";
@@ -45,11 +46,13 @@ static LOST: AtomicU64 = AtomicU64::new(0);
 static SINCE: AtomicU64 = AtomicU64::new(0);
 /// The greatest total that the socket took.
 static TOLD: AtomicU64 = AtomicU64::new(0);
+/// Points that the socket took, of all threads.
+static TAKEN: AtomicU64 = AtomicU64::new(0);
 /// When the last wait began that ended without room, by `monotonic_ns`; 0: none.
 static STUCK: AtomicU64 = AtomicU64::new(0);
 /// The descriptor, with the low half of its inode number above it; 0: none.
 static HANDLE: AtomicU64 = AtomicU64::new(0);
-static AT_EXIT: Once = Once::new();
+static AT_EXIT: AtomicBool = AtomicBool::new(false);
 
 fn environment(name: &str) -> Option<String> {
     std::env::var(name).ok()
@@ -140,10 +143,10 @@ fn start_anew_in_a_child() {
 /// The time goes in before the count, so whoever sees a count sees the time.
 pub(crate) fn count_lost() {
     start_anew_in_a_child();
-    AT_EXIT.call_once(|| {
+    if !AT_EXIT.swap(true, Relaxed) {
         // SAFETY: flush_at_exit is a plain function that does not unwind.
         unsafe { libc::atexit(flush_at_exit) };
-    });
+    }
     let now = SystemTime::now().duration_since(UNIX_EPOCH).map_or(1, |time| time.as_micros() as u64);
     let _ = SINCE.compare_exchange(0, now, AcqRel, Acquire);
     LOST.fetch_add(1, AcqRel);
@@ -225,7 +228,10 @@ fn connected() -> std::io::Result<i32> {
     if is_ours(before) {
         return Ok(before as u32 as i32);
     }
-    let socket = UnixDatagram::unbound()?;
+    let mut socket = UnixDatagram::unbound()?;
+    if socket.as_raw_fd() <= 2 {
+        socket = socket.try_clone()?; // away from the numbers of the standard streams
+    }
     socket.set_nonblocking(true)?;
     // SAFETY: the value is an int that outlives the call.
     unsafe {
@@ -262,8 +268,11 @@ fn deliver(bytes: &[u8], may_wait: bool) -> Result<(), i32> {
     if answer == Err(libc::EAGAIN) && may_wait {
         answer = wait(bytes);
     }
-    if answer.is_ok() && STUCK.load(Relaxed) != 0 {
-        STUCK.store(0, Relaxed);
+    if answer.is_ok() {
+        TAKEN.fetch_add(1, Relaxed);
+        if STUCK.load(Relaxed) != 0 {
+            STUCK.store(0, Relaxed);
+        }
     }
     answer
 }
@@ -285,6 +294,7 @@ fn offer(bytes: &[u8]) -> Result<(), i32> {
 /// taken once however many threads record.
 fn wait(bytes: &[u8]) -> Result<(), i32> {
     let mut limit = u64::from(WAIT_MAX.load(Relaxed)) * MS;
+    let taken = TAKEN.load(Relaxed);
     let now = monotonic_ns();
     let stuck = STUCK.load(Relaxed);
     if stuck != 0 {
@@ -294,7 +304,8 @@ fn wait(bytes: &[u8]) -> Result<(), i32> {
         }
     }
     let answer = offer_within(bytes, limit);
-    if limit > 0 && answer == Err(libc::EAGAIN) {
+    // Another thread may have been quicker each time. Then the daemon does take points.
+    if limit > 0 && answer == Err(libc::EAGAIN) && taken == TAKEN.load(Relaxed) {
         STUCK.store(now, Relaxed);
     }
     answer

@@ -170,7 +170,14 @@ int runCommand(const std::vector<std::string>& command) {
 int recordAround(const RecordOptions& options, const std::vector<std::string>& command) {
   RecordedPoint point = options.point;
   point.kind = "begin";
-  if (const auto failure = record(options, point)) return fail(failure->status, failure->message);
+  if (const auto failure = record(options, point)) {
+    fail(failure->status, failure->message);
+    // Nobody's backup waits for our journal. Where the begin is lost, so is the end: alone it would
+    // pair with nothing.
+    if (failure->status != kNoAccess || options.store) return failure->status;
+    countAsLost();
+    return runCommand(command);
+  }
   const int status = runCommand(command);
   // The command has done its work. A script wants its status, even if we could not record the end.
   point.kind = "end";
