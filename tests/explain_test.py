@@ -231,6 +231,48 @@ class Follow(ExplainTest):
         self.assertEqual([(line["name"], line["kind"]) for line in lines],
                          [("First", "Event"), ("Span", "Interval"), ("Twin", "Event")])
 
+    def test_follow_waits_for_a_journal(self):
+        folder = os.path.join(self.machine.root, "later")
+        process = self.machine.start("tesselctl", "explain", "--follow", "--json", "--store", folder)
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+
+        def record(name, file, sequence):
+            with open(os.path.join(folder, file + ".new"), "wb") as new:
+                new.writelines(export_bytes([point("event", "com.vantor.Live", "A", name, at=0)], time.time(), sequence))
+            os.rename(os.path.join(folder, file + ".new"), os.path.join(folder, file))
+
+        def names(count):
+            return [line["name"] for line in self.shown(process, count)[0]]
+
+        time.sleep(0.6)
+        os.mkdir(folder)
+        time.sleep(0.6)
+        open(os.path.join(folder, "a.journal"), "wb").close()  # as while the daemon makes it
+        time.sleep(0.6)
+        os.unlink(os.path.join(folder, "a.journal"))
+        record("First", "a.export", 1)
+        self.assertEqual(names(1), ["First"])
+        os.rename(os.path.join(folder, "a.export"), os.path.join(folder, "a@1.export"))  # rotation
+        record("Second", "a.export", 2)
+        self.assertEqual(names(2), ["First", "Second"])
+        for file in os.listdir(folder):
+            os.unlink(os.path.join(folder, file))
+        time.sleep(0.6)
+        record("Third", "a.export", 3)
+        self.assertEqual(names(3), ["First", "Second", "Third"])
+        process.tessel_errors.seek(0)
+        waits = process.tessel_errors.read().decode().splitlines()
+        self.assertEqual([line.split(": ")[0] for line in waits], ["Waiting for a journal"] * 2, waits)
+        self.assertIn(folder, waits[0])
+
+    def test_follow_does_not_wait_for_a_file_to_change(self):
+        text = os.path.join(self.machine.root, "letter.txt")
+        with open(text, "w", encoding="utf-8") as file:
+            file.write("no journal" * 99)
+        result = self.machine.result(self.machine.start("tesselctl", "explain", "--follow", "--store", text), timeout=20)
+        self.assertEqual((result.status, text in result.errors), (1, True), result.errors)
+
     LIVE = """
         "$0" explain --follow --json >"$1" & follower=$!
         sleep 1.5

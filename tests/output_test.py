@@ -122,6 +122,16 @@ class Terminals(OutputTest):
             self.assertEqual((result.status, result.out), (2, ""))
             self.assertRegex(result.errors, "--color.*auto.*always.*never")
 
+    def test_listings_are_headed_by_date_and_zone(self):
+        stamp = r"20\d\d-\d\d-\d\d \d\d:\d\d:\d\d"
+        for zone, name in (("UTC", "UTC"), ("Asia/Tokyo", "JST")):
+            for arguments in (("explain",), ("explain", "--summary")):
+                head = self.on_terminal(*arguments, TZ=zone, NO_COLOR="1")[1].splitlines()[0]
+                self.assertRegex(head, f"^{stamp} to {stamp} {name}$")
+            head = self.on_terminal("events", "-n", "3", TZ=zone, NO_COLOR="1")[1].splitlines()
+            self.assertRegex(head[0], f"^First row: {stamp} {name}$")
+            self.assertRegex(head[1], r"^ *\d+  \d\d-\d\d ")
+
     def test_lines_fit_80_columns_and_the_terminal(self):
         for columns in (80, 60):
             for arguments in (("explain",), ("explain", "--summary"), ("status",), ("events",),

@@ -99,8 +99,9 @@ void addPeriodOptions(CLI::App& command, ReadingOptions& options) {
       "Directory with *.journal and *.export files, or one such file [$TESSEL_TRACE_STORE, "
       "else the machine's journal]");
   command.add_option("--since", options.period.since,
-                     "Begin of the period: 2026-11-22, '2026-11-22 21:45', 21:45, yesterday, -24h, "
-                     "'2 hours ago' [a day before its end]");
+                     "Begin of the period: 2026-11-22, '2026-11-22 21:45 CET', 21:45, yesterday, "
+                     "monday, -24h, '2 hours ago', or as journalctl prints it [a day before its "
+                     "end]");
   command.add_option("--until", options.period.until, "End of the period, in the same forms [now]");
   command.add_option("--last", options.period.last,
                      "Length of the period, up to its end: 30m, 24h, 7d");

@@ -76,7 +76,7 @@ class ExplainRun {
         tally_(reading.period),
         terminal_(surroundings.terminal),
         now_(surroundings.now),
-        lines_(terminal_, reading.period),
+        lines_(terminal_, reading.period, options.follow ? std::optional(now_) : std::nullopt),
         run_(reading.store, [this](const TesselObject& object, const EntryHeader& entry) {
           inspect(object, entry);
           return true;
@@ -110,7 +110,9 @@ class ExplainRun {
   }
 
   int follow() {
-    const auto error = run_.follow(now_, flushWhileWaiting);
+    const auto error = run_.follow(now_, flushWhileWaiting, [](const std::string& reason) {
+      printError("Waiting for a journal: " + terminalText(reason) + "\n");
+    });
     return error ? failToRead(*error, reading_.store) : kDone;
   }
 

@@ -9,6 +9,7 @@
 #include "tesselctl/reading/DryRun.h"
 
 #include <algorithm>
+#include <filesystem>
 #include <thread>
 #include <unordered_map>
 #include <utility>
@@ -35,22 +36,27 @@ class WatchedStream final : public EntryStream {
       : source_(source), range_(range), progress_(progress) {}
 
   bool next() override {
+    if (!source_.next()) return false;
+    if (entries_ == 0) oldest_ = std::clamp(source_.header().realtime, range_.start, range_.end);
     if ((++entries_ & kProgressMask) == 0 && progress_) progress_(part(), entries_);
-    return source_.next();
+    return true;
   }
   const EntryHeader& header() const override { return source_.header(); }
   Entry entry() override { return source_.entry(); }
 
  private:
   double part() const {
-    const uint64_t at = std::clamp(source_.header().realtime, range_.start, range_.end);
-    return static_cast<double>(at - range_.start) / static_cast<double>(range_.end - range_.start);
+    const uint64_t at = std::clamp(source_.header().realtime, oldest_, range_.end);
+    return oldest_ == range_.end
+               ? 1
+               : static_cast<double>(at - oldest_) / static_cast<double>(range_.end - oldest_);
   }
 
   EntryStream& source_;
   const TimeRange range_;
   const DryRun::Progress& progress_;
   uint64_t entries_ = 0;
+  uint64_t oldest_ = 0;
 };
 
 // Knows which entries were passed on in an earlier look. Export files may hold several entries with
@@ -160,8 +166,20 @@ std::optional<PlatformError> DryRun::read(const Period& period, const Progress& 
   });
 }
 
-std::optional<PlatformError> DryRun::follow(Date start,
-                                            const std::function<void()>& afterEachLook) {
+// A journal may come later, or be back in a moment where its files rotate: nothing is there, or a
+// file was made and has no header yet. A file that the user names and that is no journal stays
+// none.
+bool DryRun::mayStillCome(const PlatformError& error) const {
+  if (error.code == ErrorCode::notFound) return true;
+  std::error_code ignored;
+  return error.code == ErrorCode::notAStore &&
+         (!store_ || std::filesystem::is_directory(*store_, ignored));
+}
+
+std::optional<PlatformError> DryRun::follow(
+    Date start, const std::function<void()>& afterEachLook,
+    const std::function<void(const std::string& reason)>& onWait) {
+  bool waiting = false;
   SystemClock clock;
   NewEntries news(microsecondsSince1970(start));
   while (!refused_) {
@@ -170,9 +188,13 @@ std::optional<PlatformError> DryRun::follow(Date start,
       NewEntryStream fresh(entries, news);
       extractor_.processEntries(fresh);
     });
-    if (error) return error;
+    if (error && !mayStillCome(*error)) return error;
+    if (error && !std::exchange(waiting, true)) onWait(error->words);
     // Only a look that succeeded moves the window. Entries of a failed one would be lost.
-    news.endLook(microsecondsSince1970(clock.now()));
+    if (!error) {
+      waiting = false;
+      news.endLook(microsecondsSince1970(clock.now()));
+    }
     afterEachLook();
     std::this_thread::sleep_for(kLookInterval);
   }

@@ -23,8 +23,8 @@ class DryRun {
   // Called with each trace object in the order of delivery, and with the journal entry that
   // completed it. Both are borrowed. The reading ends if it returns false.
   using Visitor = std::function<bool(const TesselObject& object, const EntryHeader& entry)>;
-  // Called every few thousand entries with the part of the period that is read, from 0 to 1, and
-  // the number of entries read.
+  // Called every few thousand entries with the part that is read, from 0 to 1, and the number of
+  // entries read. A store may be younger than the period, so the part counts from its oldest entry.
   using Progress = std::function<void(double part, uint64_t entriesRead)>;
 
   // An absent store is the machine's own journal.
@@ -32,9 +32,11 @@ class DryRun {
 
   // Reads the entries of the period. Returns an error if the store cannot be opened.
   std::optional<PlatformError> read(const Period& period, const Progress& progress);
-  // Reads entries from `start` on and waits for new ones until the visitor returns false. Returns
-  // an error if the store cannot be opened.
-  std::optional<PlatformError> follow(Date start, const std::function<void()>& afterEachLook);
+  // Reads entries from `start` on and waits for new ones until the visitor returns false. Where no
+  // journal is yet, says so once to `onWait` and waits for one. Returns an error if the store
+  // cannot be read and time will not change that.
+  std::optional<PlatformError> follow(Date start, const std::function<void()>& afterEachLook,
+                                      const std::function<void(const std::string& reason)>& onWait);
 
   // The process that wrote the entry which the visitor was given. REQUIRES: the visitor is running.
   EntryProcess currentProcess() const { return extractor_.currentProcess(); }
@@ -43,6 +45,7 @@ class DryRun {
   ExtractionReport report() const { return extractor_.report(storeReport_); }
 
  private:
+  bool mayStillCome(const PlatformError& error) const;
   std::optional<PlatformError> readOnce(TimeRange range,
                                         const std::function<void(EntryStream&)>& process);
 

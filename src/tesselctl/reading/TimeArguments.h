@@ -1,13 +1,17 @@
 // Dates and durations as they are given on a command line.
 //
-//   now  today  yesterday
-//   2026-11-22   2026-11-22 21:45   2026-11-22T21:45:00.5   ... with Z or +01:00 behind
-//   21:45  21:45:30        today
-//   @1795379995            seconds since 1970
+//   now
+//   today  yesterday  tomorrow  monday      a day begins at midnight
+//   2026-11-22  'Nov 22'                    without a year: the latest such day, tomorrow at most
+//   21:45  21:45:30.5                       today
+//   '2026-11-22 21:45'  2026-11-22T21:45  'Sun 2026-11-22 21:45:30'  'monday 21:45'
+//   ... with Z, +01:00, +0100, ' CET' or ' Europe/Berlin' behind
+//   @1795379995  1795379995.250000          seconds since 1970
 //   -24h   24h ago   1h30m ago   2 days ago
 //
-// A date without a zone is local time. A duration is a number and s, m, h, d or w, or the words for
-// them; several parts add up. Stateless; any thread, as long as none changes the time zone.
+// Each form in which journalctl prints a date is among them, but for the monotonic one. A date
+// without a zone is local time. A duration is a number and s, m, h, d or w, or the words for them;
+// several parts add up. No thread may use local time meanwhile: see TimeZone.h.
 
 #pragma once
 
@@ -17,11 +21,12 @@
 #include <string_view>
 
 #include "platform/System.h"
+#include "tesselctl/reading/CalendarDate.h"
 
 namespace tessel::ctl {
 
-// The date that `text` names, seen from `now`; nothing if it names none.
-std::optional<Date> parseDate(std::string_view text, Date now);
+// The date that `text` names, seen from `now`.
+DateResult parseDate(std::string_view text, Date now);
 // Nothing if `text` is no duration, or one of zero or of more than a thousand years.
 std::optional<std::chrono::microseconds> parseDuration(std::string_view text);
 
@@ -31,6 +36,8 @@ std::string dateText(Date date);
 std::string stampText(Date date);
 // "21:45:01", local time.
 std::string timeOfDayText(Date date);
+// "2026-11-22 21:45:01 CET", local time.
+std::string zonedText(Date date);
 // "3 s", "5 min", "2 h 10 min", "4 days".
 std::string durationText(std::chrono::microseconds duration);
 
@@ -39,6 +46,8 @@ struct Period {
   Date end;  // not in the period
   std::chrono::microseconds length() const { return end - start; }
 };
+// "2026-11-22 21:45:01 to 2026-11-23 21:45:01 CET", with two zones where clocks changed between.
+std::string periodText(const Period& period);
 
 // The values of --since, --until and --last; empty if the option is not given.
 struct PeriodArguments {

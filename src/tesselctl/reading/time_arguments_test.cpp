@@ -49,12 +49,83 @@ TEST_F(TimeArgumentsTest, DatesAreReadInEveryPromisedForm) {
       {"2 hours ago", 7200},
       {"1 day 2 h ago", 93'600},
       {"1w ago", 604'800},
+      // A day begins at midnight; a weekday is the latest one. Now is a Sunday.
+      {"tomorrow", -(3600 + 14 * 60 + 30)},
+      {"Tomorrow 08:00", -(9 * 3600 + 14 * 60 + 30)},
+      {"yesterday 22:45", 86'430},
+      {"sunday", 22 * 3600 + 45 * 60 + 30},
+      {"mon", 6 * 86'400 + 22 * 3600 + 45 * 60 + 30},
+      {"Saturday 22:45:30", 86'400},
+      // Zones, of the database and of the local clocks.
+      {"2026-11-22 21:45:30 UTC", 0},
+      {"21:45:30Z", 0},
+      {"22:45:30 CET", 0},
+      {"2026-11-22 16:45:30 America/New_York", 0},
+      {"2026-11-23 06:45:30 Asia/Tokyo", 0},
+      {"2026-11-22 America/New_York", 16 * 3600 + 45 * 60 + 30},
+      {"2026-11-22 18:45:30 -03", 0},
+      {"2026-07-01 12:00 CEST", 144 * 86'400 + 11 * 3600 + 45 * 60 + 30},
+      // As journalctl prints them: short, short-full, short-precise, short-iso, short-unix.
+      {"Nov 22 22:45:30", 0},
+      {"Nov  2 22:45:30", 20 * 86'400},
+      {"Dec 22 22:45:30", 335 * 86'400},
+      {"Sun 2026-11-22 22:45:30 CET", 0},
+      {"Sun 2026-11-22 21:45:30 UTC", 0},
+      {"2026-11-22T22:45:30+0100", 0},
+      {"1795383930", 0},
+      {"1795383930.000000", 0},
   };
   for (const auto& [text, before] : cases) {
-    EXPECT_EQ(parseDate(text, now), now - seconds{before}) << text;
+    EXPECT_EQ(parseDate(text, now).date, now - seconds{before}) << text;
   }
-  EXPECT_EQ(parseDate("@1795383930.000250999", now), now + microseconds{250});
-  EXPECT_EQ(parseDate("22:45:30.5", now), now + microseconds{500'000});
+  for (const char* text : {"@1795383930.000250999", "1795383930.000250", "Nov 22 22:45:30.000250",
+                           "2026-11-22T22:45:30.000250+0100"}) {
+    EXPECT_EQ(parseDate(text, now).date, now + microseconds{250}) << text;
+  }
+}
+
+// Clocks went back at 3:00 on October 25 and will go forward at 2:00 on March 28.
+TEST_F(TimeArgumentsTest, AnHourThatClocksRepeatOrSkipIsNamed) {
+  const struct {
+    const char* text;
+    const char* error;
+  } cases[] = {
+      {"2026-10-25 02:30",
+       "comes twice, because clocks go back: write '2026-10-25 02:30:00+02:00' (CEST) or "
+       "'2026-10-25 02:30:00+01:00' (CET)"},
+      {"2027-03-28 02:30",
+       "is skipped, because clocks go forward from 02:00:00 CET to 03:00:00 CEST: write "
+       "'2027-03-28 02:30:00+01:00' (03:30:00 CEST) or '2027-03-28 02:30:00+02:00' (01:30:00 CET)"},
+      {"2026-11-01 01:30 America/New_York",
+       "comes twice, because clocks go back: write '2026-11-01 01:30:00-04:00' (EDT) or "
+       "'2026-11-01 01:30:00-05:00' (EST)"},
+      {"2026-07-01 12:00 CET",
+       "is not in CET: clocks show CEST then; write '2026-07-01 12:00:00+02:00'"},
+      {"Mon 2026-11-22 22:45:30 CET", "is no such day: 2026-11-22 is a Sunday"},
+      {"2026-11-22 22:45 Nowhere/Land",
+       "names no time zone that is known here: 'Nowhere/Land'; zones look like Z, +01:00, CET or "
+       "Europe/Berlin"},
+  };
+  for (const auto& [text, error] : cases) {
+    const DateResult result = parseDate(text, now);
+    EXPECT_EQ(result.date, std::nullopt) << text;
+    EXPECT_EQ(result.error, error) << text;
+  }
+  for (const char* text : {"2026-10-25 01:59:59", "2026-10-25 02:30 CEST", "2026-10-25 02:30+02:00",
+                           "2026-10-25 02:30 CET", "2026-10-25 03:00"}) {
+    EXPECT_TRUE(parseDate(text, now).date) << text;
+  }
+  EXPECT_EQ(
+      *parseDate("2026-10-25 02:30 CET", now).date - *parseDate("2026-10-25 02:30 CEST", now).date,
+      std::chrono::hours{1});
+  // Where clocks change at midnight, the day begins with its first instant: Cairo skips its first
+  // hour, and Havana has it twice.
+  EXPECT_EQ(parseDate("2026-04-24 Africa/Cairo", now).date,
+            parseDate("2026-04-23T22:00:00Z", now).date);
+  EXPECT_EQ(parseDate("2026-11-01 America/Havana", now).date,
+            parseDate("2026-11-01T04:00:00Z", now).date);
+  // Another zone was looked at; the local one is in force again.
+  EXPECT_EQ(dateText(now), "2026-11-22 22:45:30");
 }
 
 TEST_F(TimeArgumentsTest, WhatIsNoDateIsNone) {
@@ -67,13 +138,16 @@ TEST_F(TimeArgumentsTest, WhatIsNoDateIsNone) {
                                            "2026-11-22 22:45:30.",
                                            "22:45:",
                                            "99:00"};
-  const std::vector<const char*> kZones = {"2026-11-22 22:45Q", "2026-11-22 22:45+1",
-                                           "2026-11-22 22:45Z "};
+  const std::vector<const char*> kZones = {
+      "2026-11-22 22:45Q",    "2026-11-22 22:45+1", "2026-11-22 22:45Z ", "22:45 ../etc/passwd",
+      "22:45 /etc/localtime", "22:45 +15:00",       "22:45 Cet"};
+  const std::vector<const char*> kWords = {"monda",      "Nov",         "Nov 32",  "Feb 30 10:00",
+                                           "Mon Nov 22", "today 25:00", "now UTC", "tomorrowx"};
   const std::vector<const char*> kEpochs = {"@", "@x", "@1.", "@99999999999999999999"};
   const std::vector<const char*> kAgo = {"-",   "-24",  "-h",      "24h",
                                          "ago", " ago", "-1h ago", "-999999999999w"};
-  for (const auto& texts : {kDates, kTimes, kZones, kEpochs, kAgo}) {
-    for (const char* text : texts) EXPECT_EQ(parseDate(text, now), std::nullopt) << text;
+  for (const auto& texts : {kDates, kTimes, kZones, kWords, kEpochs, kAgo}) {
+    for (const char* text : texts) EXPECT_EQ(parseDate(text, now).date, std::nullopt) << text;
   }
 }
 

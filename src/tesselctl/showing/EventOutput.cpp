@@ -127,6 +127,10 @@ std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
 
 }  // namespace
 
+std::string eventHeading(const SpoolRow& first, const Terminal& terminal) {
+  return terminal.paint(Colour::faint, "First row: " + zonedText(dateOf(first.event.time))) + "\n";
+}
+
 EventPath pathOf(const SpooledEvent& row) {
   const Json payload = parsed(row.payload);
   return {member(payload, "Subsystem"), member(payload, "Category")};

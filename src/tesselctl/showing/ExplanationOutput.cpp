@@ -143,7 +143,8 @@ std::string explanationFields(const Explanation& explanation, bool withPayload,
 }
 
 std::string ExplanationLines::heading() const {
-  return terminal_.paint(Colour::faint, padded("TIME", timeWidth()) +
+  return shownPeriod_ + "\n" +
+         terminal_.paint(Colour::faint, padded("TIME", timeWidth()) +
                                             padded("VERDICT", kVerdictWidth + 2) +
                                             padded("KIND", kKindWidth + 2) + "TRACE POINT") +
          "\n";

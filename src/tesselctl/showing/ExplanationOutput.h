@@ -4,6 +4,7 @@
 
 #pragma once
 
+#include <optional>
 #include <string>
 
 #include "journal/EntryStream.h"
@@ -34,8 +35,11 @@ std::string explanationFields(const Explanation& explanation, bool withPayload,
 // long path takes several lines.
 class ExplanationLines {
  public:
-  ExplanationLines(const Terminal& terminal, const Period& period)
-      : terminal_(terminal), withDay_(period.length() > std::chrono::hours{24}) {}
+  // `since` is given where no period is read: the lines begin then.
+  ExplanationLines(const Terminal& terminal, const Period& period, std::optional<Date> since)
+      : terminal_(terminal),
+        withDay_(period.length() > std::chrono::hours{24}),
+        shownPeriod_(since ? "Since " + zonedText(*since) : periodText(period)) {}
 
   std::string heading() const;
   std::string lines(const Explanation& explanation) const;
@@ -50,6 +54,7 @@ class ExplanationLines {
 
   const Terminal terminal_;
   const bool withDay_;
+  const std::string shownPeriod_;
 };
 
 }  // namespace tessel::ctl

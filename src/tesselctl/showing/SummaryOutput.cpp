@@ -302,7 +302,7 @@ std::string summaryJson(const Tally& tally, const ExtractionReport& report) {
 
 std::string summaryText(const Tally& tally, const ExtractionReport& report,
                         const Terminal& terminal) {
-  std::string out = dateText(tally.period().start) + " to " + dateText(tally.period().end) + "\n" +
+  std::string out = periodText(tally.period()) + "\n" +
                     counted(report.entriesRead, "log event", "log events") + ", " +
                     counted(tally.traceObjects(), "trace object", "trace objects") + "\n\n" +
                     verdictTable(tally, terminal);
