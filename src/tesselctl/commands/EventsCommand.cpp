@@ -7,6 +7,7 @@
 #include <chrono>
 #include <deque>
 #include <thread>
+#include <utility>
 
 #include "platform/Text.h"
 #include "tesselctl/commands/Command.h"
@@ -87,7 +88,7 @@ class EventsRun {
       return complain(state);
     } else if (!show()) {
       return complain(SpoolReader::State::damaged);
-    } else {
+    } else if (!options_.follow) {  // a list that goes on has no totals
       showTotals();
     }
     return options_.follow ? follow() : kDone;
@@ -143,21 +144,17 @@ class EventsRun {
   // Prints the rows that are new. Returns false if the spool cannot be read. --newest limits the
   // first look alone: under --follow each later row is new and must be shown.
   bool show() {
-    std::deque<std::string> last;
-    const bool limited = options_.newest != 0;
+    std::deque<SpoolRow> last;
+    const bool limited = options_.newest != 0 && !followed_;
     const bool read = spool_.readNew(options_.rows(), [&](const SpoolRow& row) {
       if (!selection_.wants(row)) return;
-      std::string line = options_.json ? eventJson(row) : eventLine(row, terminal_);
-      if (!limited || followed_) {
-        print(line);
-        return;
-      }
-      // The number of rows is not known before the last one is read, so we keep the newest lines
-      // and drop the oldest of them. Memory stays bounded by -n.
-      last.push_back(std::move(line));
+      if (!limited) return printRow(row);
+      // The number of rows is not known before the last one is read, so we keep the newest and drop
+      // the oldest of them. Memory stays bounded by -n.
+      last.push_back(row);
       if (last.size() > options_.newest) last.pop_front();
     });
-    for (const std::string& line : last) print(line);
+    for (const SpoolRow& row : last) printRow(row);
     // With --follow a reader of the pipe waits for these rows. A buffer would hold them back.
     flushOutput();
     return read;
@@ -177,11 +174,19 @@ class EventsRun {
     }
   }
 
+  // A row on a terminal shows neither year nor zone, so a line above the first does.
+  void printRow(const SpoolRow& row) {
+    if (options_.json) return print(eventJson(row));
+    if (terminal_.interactive && !std::exchange(headed_, true)) print(eventHeading(row, terminal_));
+    print(eventLine(row, terminal_));
+  }
+
   const EventsOptions& options_;
   const RowSelection selection_;
   SpoolReader spool_;
   const Terminal& terminal_;
   bool followed_ = false;
+  bool headed_ = false;
 };
 
 int showEvent(const EventsOptions& options, const Surroundings& surroundings) {
