@@ -9,7 +9,7 @@ import unittest
 import harness
 from harness import Entry, point, some_points, wait_for
 from otlp_receiver import Answer
-from status_case import CODES, UP_FOR_DAYS, Bus, StatusTest, up_for
+from status_case import CODES, STRANGER, UP_FOR_DAYS, Bus, StatusTest, up_for
 
 
 class Documents(unittest.TestCase):
@@ -175,6 +175,19 @@ class NoRun(StatusTest):
         self.age(self.tasking_file(), 20)
         self.service()
         self.assertEqual(self.problems(), {})
+
+    def test_what_follows_from_an_effect_is_shown_too(self):
+        self.service()
+        self.age(self.tasking_file(), 20)
+        marker = os.path.join(self.machine.var_tmp, harness.MARKER)
+        open(marker, "w", encoding="utf-8").close()
+        os.chown(marker, STRANGER, STRANGER)
+        self.change_record(lambda record: record.update(outcome="failed", failure="the run marker stays"))
+        self.change_record(lambda record: record["runs"][0].update(outcome="failed"))
+        self.shift_runs(-2)
+        self.assertEqual(self.problems(), {"marker_stuck": None, "run_failed": "marker_stuck", "no_completed_run": "run_failed"})
+        text = re.sub(r"\s+", " ", self.call("tesselctl", "status").out)
+        self.assertRegex(text, r"Problem marker_stuck .* Hence run_failed: .* Hence no_completed_run: No run")
 
     def test_one_that_never_ran_counts_from_tasking_on(self):
         self.assertEqual(self.problems(), {})

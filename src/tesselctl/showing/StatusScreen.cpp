@@ -244,9 +244,14 @@ class Screen {
     line(label, findingName(found.code), colour, found.words);
     more("since " + since(found.since) + ". " + found.advice);
     out_ += std::string(kLabelWidth + kAnswerWidth + 2, ' ') + found.command + '\n';
+    hence(found.code);
+  }
+  // This ends, because no finding is among the causes of its own cause.
+  void hence(FindingCode cause) {
     for (const Finding& other : status_.findings) {
-      if (other.because == found.code)
-        more("Hence " + std::string(findingName(other.code)) + ": " + other.words);
+      if (other.because != cause) continue;
+      more("Hence " + std::string(findingName(other.code)) + ": " + other.words);
+      hence(other.code);
     }
   }
 
