@@ -86,6 +86,19 @@ class Machine(StatusTest):
                          (4, False, ["no_access"]))
         self.assertNotIn("no_completed_run", status["checked"])
 
+    def test_a_tasking_file_that_says_nothing(self):
+        for text in ('{"TaskedOn": "yes"}', "{"):
+            self.machine.task(text)
+            self.assertEqual(self.problems(), {"tasking_unreadable": None})
+        self.machine.task('{"TaskedOn": false}')
+        self.assertEqual(self.problems(), {})
+
+    def test_a_file_in_the_place_of_the_state_directory(self):
+        os.rmdir(self.machine.state)
+        open(self.machine.state, "w", encoding="utf-8").close()
+        self.assertIn("record_unwritable", self.problems())
+        self.assertIn("Not a directory", self.problem("record_unwritable")["words"])
+
     def test_without_a_state_directory(self):
         os.rmdir(self.machine.state)
         self.assertEqual(self.problems(), {})

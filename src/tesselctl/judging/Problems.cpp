@@ -149,6 +149,13 @@ class StatusJudge {
           "The tasking file cannot be read by the service's user: " + *service.taskingRefused,
           whenItWas(status_.taskingWritten.value_or(status_.now)))
           .command = "namei -l " + shellWord(status_.tasking.file);
+    } else if (service.taskingKnown &&
+               status_.tasking.decision.source() == TaskingSource::unusable) {
+      Finding& unusable = add(taskingUnreadable,
+                              "The tasking file says neither yes nor no: " + status_.taskingWords,
+                              whenItWas(status_.taskingWritten.value_or(status_.now)));
+      unusable.advice = "Correct the file. Until then the machine reports nothing.";
+      unusable.command = "cat " + shellWord(status_.tasking.file);
     }
     if (service.recordRefused || endIsMissing()) {
       add(recordUnwritable,

@@ -144,13 +144,15 @@ std::optional<std::string> obstacle(const std::string& directory) {
   return {};
 }
 
-ServiceAccess accessOfService(const LaunchConfiguration& launch, const std::string& taskingFile,
+ServiceAccess accessOfService(const LaunchConfiguration& launch, const Tasking& tasking,
                               uid_t user) {
   ServiceAccess access;
-  const auto tasking = tryToRead(user, taskingFile);
-  access.taskingKnown = tasking.has_value();
-  if (tasking && *tasking != 0 && codeOf(*tasking) != ErrorCode::notFound)
-    access.taskingRefused = fileError(taskingFile, *tasking).words;
+  // An internal build reports whatever the file says.
+  const bool internal = tasking.decision.source() == TaskingSource::internalBuild;
+  const auto reading = internal ? std::optional<int>(0) : tryToRead(user, tasking.file);
+  access.taskingKnown = reading.has_value();
+  if (reading && *reading != 0 && codeOf(*reading) != ErrorCode::notFound)
+    access.taskingRefused = fileError(tasking.file, *reading).words;
   struct stat facts {};
   // Without a directory nothing is wrong yet: the first run makes it.
   if (::stat(launch.stateDirectory.c_str(), &facts) != 0) {
@@ -168,7 +170,8 @@ ServiceAccess accessOfService(const LaunchConfiguration& launch, const std::stri
 // A file that we may not reach looks like a file that is absent. Without this a machine that nobody
 // may look at would seem to be one that never ran.
 std::optional<std::string> refusalOf(const std::string& directory) {
-  if (::access(directory.c_str(), R_OK | X_OK) == 0 || errno != EACCES) return {};
+  // With the dot, a file in the place of the directory is no matter of access.
+  if (::access((directory + "/.").c_str(), R_OK | X_OK) == 0 || errno != EACCES) return {};
   return fileError("state directory " + directory, EACCES).words;
 }
 
@@ -221,7 +224,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   status.taskingWords = taskingWords(status.tasking, launch);
   const bool internal = status.tasking.decision.source() == TaskingSource::internalBuild;
   status.taskingWritten = fileTime(internal ? launch.osReleasePath : status.tasking.file);
-  status.service = accessOfService(launch, status.tasking.file, service);
+  status.service = accessOfService(launch, status.tasking, service);
   lookAtDeferral(status, launch, state);
   status.markers = lookForMarkers(service);
   lookAtRuns(status, state);

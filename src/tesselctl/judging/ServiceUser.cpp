@@ -33,7 +33,7 @@ int readFirstByte(const std::string& path) {
 }
 
 int askToChange(const std::string& directory) {
-  return ::access(directory.c_str(), W_OK | X_OK) == 0 ? 0 : errno;
+  return ::access((directory + "/.").c_str(), W_OK | X_OK) == 0 ? 0 : errno;
 }
 
 bool become(uid_t user) {
