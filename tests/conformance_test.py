@@ -69,12 +69,15 @@ class Runner:
         self.process.stdin.write((json_line(point("burst"), "v") + b"\n") * count)
         self.process.stdin.flush()
         waiting = bytearray(4)
-        while True:  # until it has read all, and was given time to send the last ones
+        while True:  # until it has read all and sleeps, since it waits for another line
             fcntl.ioctl(self.process.stdin, termios.FIONREAD, waiting)
-            if waiting == bytes(4):
-                time.sleep(0.3)
+            if waiting == bytes(4) and self.sleeps():
                 return None
             time.sleep(0.01)
+
+    def sleeps(self):
+        with open(f"/proc/{self.pid}/stat", encoding="utf-8", errors="replace") as file:
+            return file.read().rpartition(")")[2].split()[0] == "S"
 
     def close(self):
         """Exit status and lines of stderr."""
