@@ -69,8 +69,9 @@ Judged judge(const std::string& path) {
   Judge service(JudgedMachine{});
   DryRun run(path, [&](const TesselObject& object, const EntryHeader&) {
     const FilterDecision decision = service.inspect(object);
-    ++judged.verdicts[std::string(object.tesselType()) + " " + std::string(object.name().text()) +
-                      " " + std::string(verdictName(decision.classification))];
+    ++judged.verdicts[std::string(object.tesselType()) + " " +
+                      std::string(object.name().textOr("no name")) + " " +
+                      std::string(verdictName(decision.classification))];
     return true;
   });
   const Period day{Date{std::chrono::microseconds{kStart}},
