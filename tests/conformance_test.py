@@ -68,16 +68,14 @@ class Runner:
             return self.do(line(point("burst"), f"r {count}"))
         self.process.stdin.write((json_line(point("burst"), "v") + b"\n") * count)
         self.process.stdin.flush()
-        waiting = bytearray(4)
-        while True:  # until it has read all and sleeps, since it waits for another line
-            fcntl.ioctl(self.process.stdin, termios.FIONREAD, waiting)
-            if waiting == bytes(4) and self.sleeps():
-                return None
-            time.sleep(0.01)
+        return self.wait_until_idle()
 
-    def sleeps(self):
-        with open(f"/proc/{self.pid}/stat", encoding="utf-8", errors="replace") as file:
-            return file.read().rpartition(")")[2].split()[0] == "S"
+    def wait_until_idle(self):
+        """Until it has read all lines and sleeps, since it waits for another."""
+        state = ""
+        while state != "S" or fcntl.ioctl(self.process.stdin, termios.FIONREAD, bytes(4)) != bytes(4):
+            with open(f"/proc/{self.pid}/stat", encoding="utf-8", errors="replace") as file:
+                state = file.read().rpartition(")")[2].split()[0]
 
     def close(self):
         """Exit status and lines of stderr."""
