@@ -115,10 +115,10 @@ typedef struct tessel_point {
   size_t attribute_count;
   const char* interval_id; /* pairs begin and end; absent: an id of the token's own */
   bool system_scope;       /* begin and end may come from different processes */
-  /* May be reported. Without it the trace point stays on the machine, but its subsystem and category
-   * are counted, and the count may be sent. */
+  /* May be reported. Without it the trace point stays on the machine, but its subsystem and
+   * category are counted, and the count may be sent. */
   bool telemetry;
-  bool no_wait;            /* rather lost than waited for */
+  bool no_wait; /* rather lost than waited for */
 } tessel_point;
 
 /* Links the end of an interval to its begin. The members are the header's own. */
