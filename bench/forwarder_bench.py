@@ -24,7 +24,7 @@ import time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "..", "tests"))
-from forwarder_test import make_spool  # noqa: E402
+from forwarder_case import make_spool  # noqa: E402
 
 def some_payload(random):
     """An event as the service spools them: few subsystems and names, numbers that all differ."""

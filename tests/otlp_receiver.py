@@ -10,7 +10,7 @@ from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 
 
 class Answer:
-    """The answer to one request. `kind` is whole, or cut: then the connection breaks in the middle."""
+    """The answer to one request. `kind` is whole, or says where the connection breaks: cut in the body, or in the head."""
 
     def __init__(self, status=200, body=b"{}", headers=(), kind="whole", delay=0.0):
         self.status, self.body, self.headers, self.kind, self.delay = status, body, dict(headers), kind, delay
@@ -93,9 +93,12 @@ class Receiver:
         for name, value in answer.headers.items():
             handler.send_header(name, value)
         handler.send_header("Content-Length", str(len(answer.body) + (100 if answer.kind == "cut" else 0)))
-        handler.end_headers()
-        handler.wfile.write(answer.body)
-        if answer.kind == "cut":
+        if answer.kind == "head":
+            handler.flush_headers()
+        else:
+            handler.end_headers()
+            handler.wfile.write(answer.body)
+        if answer.kind != "whole":
             handler.wfile.flush()
             handler.connection.shutdown(socket.SHUT_RDWR)
             handler.close_connection = True

@@ -11,28 +11,49 @@
 
 #include <algorithm>
 
+#include "platform/Text.h"
+
 namespace tessel {
 
 namespace {
 
-// A longer answer is cut off, which ends the connection. Up to this length we read and discard what
-// we do not keep, so that the connection can be used again.
-constexpr size_t kMostRead = size_t{16} << 20;
 // The fastest level makes a body of records a tenth as long. Slower ones gain little more.
 constexpr int kCompressionLevel = 1;
 constexpr int kGzipWindow = 15 + 16;  // zlib: the largest window, and 16 asks for a gzip header
 
 struct Reading {
   std::string body;
-  size_t received = 0;
+  bool tooLong = false;
+  bool headEnded = false;
 };
 
 // Answering less than `count` makes libcurl end the transfer.
 size_t takeBody(char* bytes, size_t /*one*/, size_t count, void* target) {
   auto& reading = *static_cast<Reading*>(target);
-  reading.received += count;
-  reading.body.append(bytes, std::min(count, Collector::kMaxAnswerBytes - reading.body.size()));
-  return reading.received > kMostRead ? 0 : count;
+  const size_t room = Collector::kMaxAnswerBytes - reading.body.size();
+  reading.tooLong = count > room;
+  reading.body.append(bytes, std::min(count, room));
+  return reading.tooLong ? 0 : count;
+}
+
+// libcurl takes a head that breaks off for a whole one. Only an empty line ends a head. An interim
+// answer has a head of its own, so each status line begins anew.
+size_t takeHeadLine(char* bytes, size_t /*one*/, size_t count, void* target) {
+  const std::string_view line(bytes, count);
+  static_cast<Reading*>(target)->headEnded = line == "\r\n" || line == "\n";
+  return count;
+}
+
+// "Application/JSON; charset=utf-8" becomes "application/json".
+std::string mediaTypeOf(CURL* request) {
+  const char* header = nullptr;
+  if (curl_easy_getinfo(request, CURLINFO_CONTENT_TYPE, &header) != CURLE_OK || header == nullptr)
+    return {};
+  std::string type(trimmed(std::string_view(header).substr(0, std::string_view(header).find(';'))));
+  std::transform(type.begin(), type.end(), type.begin(), [](char letter) {
+    return letter >= 'A' && letter <= 'Z' ? static_cast<char>(letter - 'A' + 'a') : letter;
+  });
+  return type;
 }
 
 // libcurl calls this about once a second while it waits, and ends the request if the answer is not
@@ -117,6 +138,8 @@ CurlCollector::CurlCollector(const ForwarderSettings& settings, std::string_view
   to.set(CURLOPT_USERAGENT, "statora_forwarder/" TESSEL_VERSION);
   to.set(CURLOPT_POST, 1L);
   to.set(CURLOPT_WRITEFUNCTION, &takeBody);
+  to.set(CURLOPT_HEADERFUNCTION, &takeHeadLine);
+  to.set(CURLOPT_SUPPRESS_CONNECT_HEADERS, 1L);
   to.set(CURLOPT_ERRORBUFFER, to.reason);
   to.set(CURLOPT_NOPROGRESS, 0L);
   to.set(CURLOPT_XFERINFOFUNCTION, &checkCancelled);
@@ -131,10 +154,13 @@ CurlCollector::~CurlCollector() = default;
 
 CollectorAnswer CurlCollector::post(std::string_view body) {
   Handles& with = *handles_;
+  CollectorAnswer answer;
   std::string_view sent = body;
   if (compress_) {
-    if (!with.gzip.compress(body, with.compressed))
-      return {0, {}, "the body cannot be compressed", {}, 0};
+    if (!with.gzip.compress(body, with.compressed)) {
+      answer.error = "the body cannot be compressed";
+      return answer;
+    }
     sent = with.compressed;
   }
   Reading reading;
@@ -142,18 +168,24 @@ CollectorAnswer CurlCollector::post(std::string_view body) {
   with.set(CURLOPT_POSTFIELDS, sent.data());
   with.set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(sent.size()));
   with.set(CURLOPT_WRITEDATA, &reading);
+  with.set(CURLOPT_HEADERDATA, &reading);
   const CURLcode result = curl_easy_perform(with.request);
 
-  CollectorAnswer answer;
   answer.bytesSent = sent.size();
-  answer.body = std::move(reading.body);
-  // If we cut the answer off, its status had already arrived, and only the status matters.
-  const bool cutOff = result == CURLE_WRITE_ERROR && reading.received > kMostRead;
-  if (result != CURLE_OK && !cutOff) {
+  if (result == CURLE_OK && !reading.headEnded) {
+    answer.error = "the head of the answer breaks off";
+    return answer;
+  }
+  // Of a failure the status is enough, however long its body.
+  long status = 0;
+  curl_easy_getinfo(with.request, CURLINFO_RESPONSE_CODE, &status);
+  if (result != CURLE_OK && !(reading.tooLong && status >= 300)) {
     answer.error = with.reason[0] != '\0' ? with.reason : curl_easy_strerror(result);
     return answer;
   }
-  curl_easy_getinfo(with.request, CURLINFO_RESPONSE_CODE, &answer.status);
+  answer.status = status;
+  answer.mediaType = mediaTypeOf(with.request);
+  answer.body = std::move(reading.body);
   curl_off_t seconds = 0;
   if (curl_easy_getinfo(with.request, CURLINFO_RETRY_AFTER, &seconds) == CURLE_OK && seconds > 0) {
     answer.retryAfter = std::chrono::seconds{seconds};

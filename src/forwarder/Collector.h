@@ -17,7 +17,8 @@ namespace tessel {
 
 struct CollectorAnswer {
   long status = 0;                                 // of HTTP; 0 if no answer arrived
-  std::string body;                                // its beginning, at most kMaxAnswerBytes
+  std::string mediaType;                           // of the body, see Encoder::readSuccess()
+  std::string body;                                // all of it, at most kMaxAnswerBytes
   std::string error;                               // why no answer arrived, in words
   std::optional<std::chrono::seconds> retryAfter;  // the wait that the collector asks for, positive
   size_t bytesSent = 0;                            // of the request's body, after compression
@@ -25,7 +26,8 @@ struct CollectorAnswer {
 
 class Collector {
  public:
-  static constexpr size_t kMaxAnswerBytes = size_t{64} << 10;
+  // The most that the protocol lets a client read of an answer.
+  static constexpr size_t kMaxAnswerBytes = size_t{4} << 20;
 
   virtual ~Collector() = default;
   // Sends one request and waits for its answer for as long as the settings allow.
@@ -33,8 +35,8 @@ class Collector {
 };
 
 // Sends with HTTP over a connection that stays open. It verifies the server's certificate and
-// follows no redirect. It keeps the first kMaxAnswerBytes of an answer and discards what follows.
-// An answer of more than 16 MiB is cut off, and its status still counts.
+// follows no redirect. A success counts only if the answer arrived whole, from its head to the end
+// of its body. Of another answer the status is enough.
 //
 // Threads: one at a time, except for cancel(). REQUIRES: curl_global_init() was called.
 class CurlCollector final : public Collector {

@@ -54,13 +54,17 @@ class Encoder {
                                             std::string_view spoolId) const = 0;
   // The body of the request that carries `records`.
   virtual std::string body(std::span<const OutgoingRecord> records) const = 0;
-  // Reads the body of an answer. A body that cannot be understood counts as no rejection.
-  virtual PartialSuccess partialSuccess(std::string_view answer) const = 0;
+  // Reads an answer with a status of success. Absent if it is no answer of this protocol: then
+  // somebody else answered, and nothing says that a collector has the records. `mediaType` is in
+  // small letters and without parameters; it is empty if the answer names none.
+  virtual std::optional<PartialSuccess> readSuccess(std::string_view mediaType,
+                                                    std::string_view body) const = 0;
 };
 
 struct OutputFormat {
-  std::string_view protocol;  // its name in OTEL_EXPORTER_OTLP_PROTOCOL
-  std::string_view path;      // of its endpoint, below the collector's address
+  std::string_view format;    // its name in TESSEL_FORWARD_FORMAT
+  std::string_view protocol;  // its name in OTEL_EXPORTER_OTLP_PROTOCOL; empty if it is not OTLP
+  std::string_view path;      // what is added to the collector's address; empty: nothing
   std::unique_ptr<Encoder> (*makeEncoder)(const ResourceFacts& facts);
 };
 

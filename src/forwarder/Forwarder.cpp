@@ -11,80 +11,12 @@
 #include "forwarder/Forwarder.h"
 
 #include <algorithm>
-#include <cmath>
 #include <utility>
 
 #include "platform/Invariant.h"
 #include "platform/Text.h"
 
 namespace tessel {
-
-// Verdicts, waits and pace.
-//
-// OTLP lists the statuses after which a client may send again. We add one rule: 401, 403, 404, 405,
-// 407 and redirects are about the way to the collector and not about the records. If they counted
-// as refusals, a wrong password would set good records aside.
-
-namespace {
-
-// A collector may ask for a longer wait by mistake. After an hour it is asked again.
-constexpr std::chrono::seconds kLongestAsked{3600};
-// Bytes of a collector's answer that we quote: enough for a sentence, short enough for a log line.
-constexpr size_t kMaxWords = 300;
-
-}  // namespace
-
-Verdict verdictOn(const CollectorAnswer& answer) {
-  switch (answer.status) {
-    case 0:
-    case 429:
-    case 502:
-    case 503:
-    case 504:
-      return Verdict::later;
-    case 401:
-    case 403:
-    case 404:
-    case 405:
-    case 407:
-      return Verdict::hold;
-    default:
-      break;
-  }
-  if (answer.status / 100 == 2) return Verdict::accepted;
-  return answer.status / 100 == 3 ? Verdict::hold : Verdict::refused;
-}
-
-std::string answerWords(const CollectorAnswer& answer) {
-  if (answer.status == 0) return plainText(answer.error, " ");
-  std::string words = std::to_string(answer.status);
-  if (!answer.body.empty())
-    words += ": " + plainText(std::string_view(answer.body).substr(0, kMaxWords), " ");
-  return words;
-}
-
-std::chrono::milliseconds Backoff::wait(uint32_t failures, double chance,
-                                        std::optional<std::chrono::seconds> asked) const {
-  // 30 doublings bring any wait above the longest one. More could overflow to infinity.
-  const double doublings = std::min(failures - 1, uint32_t{30});
-  const double full = std::min(static_cast<double>(first_.count()) * std::exp2(doublings),
-                               static_cast<double>(most_.count()));
-  const std::chrono::milliseconds own{static_cast<int64_t>(full * (0.5 + chance / 2))};
-  if (!asked) return own;
-  const std::chrono::milliseconds wanted = std::min(*asked, kLongestAsked);
-  const auto spread = static_cast<double>(std::max(first_, wanted / 2).count());
-  return wanted + std::chrono::milliseconds{static_cast<int64_t>(chance * spread)};
-}
-
-std::chrono::nanoseconds Pace::waitAt(std::chrono::nanoseconds now) const {
-  return std::max(next_ - now, std::chrono::nanoseconds{0});
-}
-
-void Pace::sent(uint64_t records, std::chrono::nanoseconds now) {
-  if (recordsPerSecond_ == 0) return;
-  // The wait comes after the request that causes it, so the first one of a day goes out at once.
-  next_ = now + std::chrono::nanoseconds{std::chrono::seconds{1}} * records / recordsPerSecond_;
-}
 
 namespace {
 
@@ -179,7 +111,7 @@ Forwarder::Sent Forwarder::send(Records part) {
     ForwarderCounters& counters = world_.state.counters();
     ++counters.requests;
     counters.bytesSent += answer.bytesSent;
-    const Verdict verdict = verdictOn(answer);
+    const Verdict verdict = verdictOn(answer, world_.encoder);
     if (verdict == Verdict::accepted || verdict == Verdict::refused) return settle(part, answer);
     noteFailure(answer);
     if (verdict == Verdict::hold) return fail(ForwarderOutcome::held, answerWords(answer));
@@ -216,7 +148,7 @@ void Forwarder::noteFailure(const CollectorAnswer& answer) {
 }
 
 Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
-  if (verdictOn(answer) == Verdict::refused) {
+  if (verdictOn(answer, world_.encoder) == Verdict::refused) {
     if (part.size() > 1) return Sent::refused;
     if (!setAside(part.front().event, answer.status, answerWords(answer))) return Sent::failed;
     if (++refusals_ < options_.refusalsInARow) return Sent::accepted;
@@ -225,7 +157,8 @@ Forwarder::Sent Forwarder::settle(Records part, const CollectorAnswer& answer) {
   }
   refusals_ = 0;
   // After a partial success nothing is sent again: the collector would take the good records twice.
-  const PartialSuccess partial = world_.encoder.partialSuccess(answer.body);
+  const PartialSuccess partial =
+      world_.encoder.readSuccess(answer.mediaType, answer.body).value_or(PartialSuccess{});
   if (partial.rejected > 0) {
     kForwarderLog.error("The collector rejected %llu records: %@", partial.rejected,
                         partial.message);

@@ -20,6 +20,7 @@
 #include <utility>
 
 #include "platform/Json.h"
+#include "platform/Text.h"
 
 namespace tessel {
 
@@ -119,7 +120,8 @@ class OtlpEncoder final : public Encoder {
   std::optional<std::string> record(const SpooledEvent& event,
                                     std::string_view spoolId) const override;
   std::string body(std::span<const OutgoingRecord> records) const override;
-  PartialSuccess partialSuccess(std::string_view answer) const override;
+  std::optional<PartialSuccess> readSuccess(std::string_view mediaType,
+                                            std::string_view body) const override;
 
  private:
   std::string resource_;  // the same in every body
@@ -184,13 +186,18 @@ std::string OtlpEncoder::body(std::span<const OutgoingRecord> records) const {
   return all;
 }
 
-// A collector may answer with any body, even an HTML page. A body that we do not understand counts
-// as no rejection, because the status has already said that the batch was taken.
-PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {
-  const auto json = nlohmann::json::parse(answer, nullptr, false);
+// The protocol's answer to a request is an empty body or an object with nothing in it but a partial
+// success. A member that we do not know may stand beside one. An object of other members alone is
+// no such answer: {"error": "sign in first"} must not count.
+std::optional<PartialSuccess> OtlpEncoder::readSuccess(std::string_view mediaType,
+                                                       std::string_view body) const {
+  if (trimmed(body).empty()) return PartialSuccess{};
+  if (mediaType == "text/html") return {};
+  const auto json = Json::parse(body, nullptr, false);
   if (!json.is_object()) return {};
   const auto partial = json.find("partialSuccess");
-  if (partial == json.end() || !partial->is_object()) return {};
+  if (partial == json.end()) return json.empty() ? std::optional(PartialSuccess{}) : std::nullopt;
+  if (!partial->is_object()) return {};
   PartialSuccess told;
   if (const auto rejected = partial->find("rejectedLogRecords"); rejected != partial->end()) {
     told.rejected = integerOf(*rejected);
@@ -204,7 +211,7 @@ PartialSuccess OtlpEncoder::partialSuccess(std::string_view answer) const {
 
 }  // namespace
 
-extern constexpr OutputFormat kOtlpJson{"http/json", "/v1/logs",
+extern constexpr OutputFormat kOtlpJson{"otlp", "http/json", "/v1/logs",
                                         [](const ResourceFacts& facts) -> std::unique_ptr<Encoder> {
                                           return std::make_unique<OtlpEncoder>(facts);
                                         }};

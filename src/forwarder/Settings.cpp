@@ -154,16 +154,30 @@ std::optional<std::string> acceptedDestination(const std::string& text, bool all
   return scheme + "://" + host + (port.empty() ? "" : ":" + port);
 }
 
+// TESSEL_FORWARD_FORMAT names the format. Only OTLP has protocols to choose from.
 const OutputFormat* readOutput(Variables& variables) {
+  const std::span<const OutputFormat* const> formats = outputFormats();
+  const auto choose = [&](const Variable& variable, std::string_view OutputFormat::*name,
+                          const auto& eligible) {
+    std::string known;
+    for (const OutputFormat* format : formats) {
+      if (!eligible(*format)) continue;
+      if (format->*name == variable.value) return format;
+      if (known.find(format->*name) == std::string::npos)
+        known.append(known.empty() ? "" : " or ").append(format->*name);
+    }
+    variables.complain(variable.name, variable.value, known);
+    return formats.front();
+  };
+  const Variable wanted{
+      "TESSEL_FORWARD_FORMAT",
+      variables.value("TESSEL_FORWARD_FORMAT").value_or(std::string(formats.front()->format))};
+  const OutputFormat* const first =
+      choose(wanted, &OutputFormat::format, [](const OutputFormat&) { return true; });
   const auto protocol = variables.standard("PROTOCOL");
-  if (!protocol) return outputFormats().front();
-  std::string known;
-  for (const OutputFormat* format : outputFormats()) {
-    if (format->protocol == protocol->value) return format;
-    known.append(known.empty() ? "" : " or ").append(format->protocol);
-  }
-  variables.complain(protocol->name, protocol->value, known);
-  return outputFormats().front();
+  if (!protocol || first->protocol.empty()) return first;
+  return choose(*protocol, &OutputFormat::protocol,
+                [&](const OutputFormat& format) { return format.format == first->format; });
 }
 
 void readEndpoint(Variables& variables, ForwarderSettings& settings) {

@@ -7,6 +7,7 @@
 // $CREDENTIALS_DIRECTORY: otlp-headers, otlp-certificate, otlp-client-certificate, otlp-client-key.
 //
 //                                                                                 default
+//   TESSEL_FORWARD_FORMAT      the output format                                  otlp
 //   TESSEL_FORWARD_RATE        records per second; 0: no limit                      100
 //   TESSEL_FORWARD_SPREAD      seconds over which a start is spread                 300
 //   TESSEL_FORWARD_INTERVAL    seconds between looks for new events                 30

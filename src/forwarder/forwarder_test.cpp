@@ -44,7 +44,9 @@ struct LinesEncoder final : Encoder {
     for (const OutgoingRecord& record : records) lines += record.text + '\n';
     return lines;
   }
-  PartialSuccess partialSuccess(std::string_view) const override { return {}; }
+  std::optional<PartialSuccess> readSuccess(std::string_view, std::string_view) const override {
+    return PartialSuccess{};
+  }
 };
 
 // The numbers of the records in a body, in order.
@@ -141,7 +143,7 @@ TEST_F(ForwarderTest, OnlyRefusedRecordsAreSetAside) {
 
 TEST_F(ForwarderTest, RefusalsInARowHoldEverythingUp) {
   send(12);
-  refuse({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12}, 500);
+  refuse({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12});
   EXPECT_EQ(deliver(), ForwarderOutcome::held);
   EXPECT_EQ(setAside(), 4);
   EXPECT_EQ(waiting(), 8);

@@ -1,6 +1,6 @@
 // Verdicts, waits and pace.
 
-#include "forwarder/Forwarder.h"
+#include "forwarder/DeliveryPolicy.h"
 
 #include <gtest/gtest.h>
 
@@ -16,43 +16,48 @@ using std::chrono::seconds;
 TEST(PolicyTest, EveryStatusHasItsVerdict) {
   const std::pair<Verdict, std::vector<long>> kCases[] = {
       {Verdict::accepted, {200, 201, 204, 299}},
-      {Verdict::later, {0, 429, 502, 503, 504}},
-      {Verdict::hold, {301, 304, 401, 403, 404, 405, 407}},
-      {Verdict::refused, {100, 400, 408, 413, 422, 500, 501, 505}},
+      {Verdict::later, {0, 408, 425, 429, 502, 503, 504, 507, 520, 599}},
+      {Verdict::hold, {100, 301, 304, 401, 402, 403, 404, 405, 407, 410, 415, 501, 505, 511}},
+      {Verdict::refused, {400, 413, 422, 500}},
   };
+  const auto encoder = outputFormats().front()->makeEncoder({});
   CollectorAnswer answer;
   for (const auto& [verdict, statuses] : kCases) {
     for (const long status : statuses) {
       answer.status = status;
-      EXPECT_EQ(verdictOn(answer), verdict) << status;
+      EXPECT_EQ(verdictOn(answer, *encoder), verdict) << status;
     }
   }
 }
 
-TEST(OtlpJsonTest, PartialSuccessIsReadInEveryForm) {
+TEST(OtlpJsonTest, OnlyAnAnswerOfTheProtocolIsASuccess) {
   const struct {
     const char* body;
-    uint64_t rejected;
+    std::optional<uint64_t> rejected;
     const char* message;
   } cases[] = {
       {R"({"partialSuccess":{"rejectedLogRecords":"7","errorMessage":"why"}})", 7, "why"},
-      {R"({"partialSuccess":{"rejectedLogRecords":7}})", 7, ""},
+      {R"({"partialSuccess":{"rejectedLogRecords":7},"later":1})", 7, ""},
       {R"({"partialSuccess":{"errorMessage":"a warning"}})", 0, "a warning"},
       {R"({"partialSuccess":{"rejectedLogRecords":-7}})", 0, ""},
       {R"({"partialSuccess":{"rejectedLogRecords":{}}})", 0, ""},
-      {R"({"partialSuccess":[1]})", 0, ""},
-      {"{}", 0, ""},
+      {"{}\n", 0, ""},
       {"", 0, ""},
-      {"7", 0, ""},
-      {"<html>", 0, ""},
-      {R"({"partialSuccess":{"rejectedLogRecords":"7")", 0, ""},
+      {R"({"partialSuccess":[1]})", {}, ""},
+      {R"({"error":"sign in"})", {}, ""},
+      {"7", {}, ""},
+      {"<html>", {}, ""},
+      {R"({"partialSuccess":{"rejectedLogRecords":"7")", {}, ""},
   };
   const auto encoder = outputFormats().front()->makeEncoder({});
   for (const auto& c : cases) {
-    const PartialSuccess told = encoder->partialSuccess(c.body);
-    EXPECT_EQ(told.rejected, c.rejected) << c.body;
-    EXPECT_EQ(told.message, c.message) << c.body;
+    const auto told = encoder->readSuccess("application/json", c.body);
+    ASSERT_EQ(told.has_value(), c.rejected.has_value()) << c.body;
+    if (!told) continue;
+    EXPECT_EQ(told->rejected, *c.rejected) << c.body;
+    EXPECT_EQ(told->message, c.message) << c.body;
   }
+  EXPECT_FALSE(encoder->readSuccess("text/html", "{}"));
 }
 
 TEST(PolicyTest, WordsOfACollectorAreFitForATerminal) {
