@@ -23,24 +23,6 @@ class CtlTest(MachineTest):
 
 
 class Statuses(CtlTest):
-    def test_each_outcome_has_its_status_and_is_named(self):
-        for arguments, status, said in (
-                ((), 2, "subcommand"), (("nope",), 2, "'nope'"), (("explain", "--nope"), 2, "--nope"),
-                (("explain", "--store", "/nowhere/Permission denied"), 1, "/nowhere/Perm"), (("events",), 1, self.spool()),
-                (("report",), 2, "--html"), (("report", "--html", "/nowhere/x"), 1, "/nowhere/x"),
-                (("report", "--html", "-", "--last-run"), 1, self.machine.state),
-                (("compare", "usual", "unusual"), 2, "unusual"), (("explain", "--platform", "quarro"), 2, "'quarro'"),
-                (("explain", "--verdict", "good"), 2, "'good'"), (("defer",), 2, "subcommand"),
-                (("explain", "--follow", "--summary"), 2, "--follow"), (("events", "--since", "soon"), 2, "'soon'")):
-            self.machine.write_export([log_event("x")])
-            result = self.machine.ctl(*arguments)
-            self.assertEqual(result.status, status, (arguments, result.errors))
-            self.assertIn(said, result.errors + result.out)
-
-    def test_a_senseless_launch_variable_is_a_usage_error(self):
-        result = self.machine.ctl("status", TESSEL_DEFER_RETRY="soon")
-        self.assertEqual((result.status, "TESSEL_DEFER_RETRY" in result.errors), (2, True), result.errors)
-
     def test_help_is_narrow_and_has_an_example(self):
         for command in ("explain", "compare", "events", "rules", "status", "defer", "tasking", "report"):
             result = self.machine.ctl(command, "--help")
@@ -61,7 +43,8 @@ class Statuses(CtlTest):
             result = self.as_nobody(*arguments)
             self.assertEqual(result.returncode, 4, (arguments, result.stderr))
             self.assertIn("ermission denied", result.stderr)
-            self.assertRegex(result.stderr, "Run tesselctl as|Join the group")
+            self.assertRegex(result.stderr, "; run tesselctl as root|; run tesselctl as a user who may read the store")
+            self.assertEqual(result.stderr.count("\n"), 1)
         os.chmod(self.machine.store, 0o755)
         os.close(os.open(os.path.join(self.machine.store, "closed.export"), os.O_CREAT, 0o600))
         self.assertEqual(self.as_nobody("explain").returncode, 4, "one file of two was read")
@@ -94,8 +77,6 @@ class Events(CtlTest):
         self.assertEqual(names("--subsystem", "com.vantor.B", "--name", "*.tessel"), ["com.vantor.performance.tessel"])
         self.assertEqual(names("--category", "x", "--name", "ts__*"), ["ts__com.vantor.A__x__One"])
         self.assertEqual(names("-n", "2"), rows[-2:])
-        for count in ("0", "-1", "x"):
-            self.assertEqual(self.machine.ctl("events", "-n", count).status, 2)
         self.assertEqual(names("--last", "1h"), rows)
         self.assertEqual(names("--until", "-1h"), [])
 

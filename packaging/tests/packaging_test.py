@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""Checks units, manual pages, completion, catalog and scripts without installing them."""
+"""Checks units, manual pages, catalog and scripts without installing them."""
 
 import glob
 import os
@@ -209,21 +209,6 @@ class Texts(unittest.TestCase):
         self.assertTrue(warnings)
         # "%@" alone stands for the texts of linux/Findings.cpp, which have a test beside them.
         self.assertEqual([text for text in warnings if not text.startswith((*table, "%@"))], [])
-
-    def test_completion(self):
-        script = os.path.join(PACKAGING, "completion", "tesselctl")
-        offered = {}
-        for words in ("tesselctl ", "tesselctl defer ", "tesselctl tasking s"):
-            # Stands in for the framework's own function.
-            line = ("_init_completion() { words=(%s); cword=$((${#words[@]} - 1)); cur=${words[cword]};"
-                    " prev=${words[cword-1]}; }; . '%s'; _tesselctl; echo \"${COMPREPLY[@]}\"")
-            array = " ".join("'%s'" % word for word in words.split(" "))
-            result = run("bash", "-c", line % (array, script))
-            self.assertEqual(result.stderr, "")
-            offered[words] = result.stdout.split()
-        self.assertIn("explain", offered["tesselctl "])
-        self.assertEqual(offered["tesselctl defer "], ["on", "off"])
-        self.assertEqual(offered["tesselctl tasking s"], ["show"])
 
     def test_scripts(self):
         scripts = glob.glob(os.path.join(PACKAGING, "debian", "*.p*"))

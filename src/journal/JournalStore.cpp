@@ -253,6 +253,16 @@ std::variant<std::unique_ptr<JournalStore>, PlatformError> JournalStore::open(
   return std::unique_ptr<JournalStore>(new JournalStore(std::move(state)));
 }
 
+std::unique_ptr<JournalStore> JournalStore::ofExport(UniqueFd stream, std::string name,
+                                                     TimeRange range, FieldTokenizer& tokenizer,
+                                                     const StopFlag& stop) {
+  StoreFiles files;
+  files.files.push_back({std::move(name), StoreFileKind::exportStream, std::move(stream), 0});
+  auto state = std::make_unique<State>(range, tokenizer, stop, nullptr);
+  state->openFiles(std::move(files));
+  return std::unique_ptr<JournalStore>(new JournalStore(std::move(state)));
+}
+
 // The state itself is the stream: it sees every entry that the merge delivers, in or out of range.
 EntryStream& JournalStore::entries() { return *state_; }
 

@@ -15,6 +15,7 @@
 
 #include "journal/EntryStream.h"
 #include "journal/StoreReport.h"
+#include "os/UniqueFd.h"
 #include "platform/Error.h"
 #include "platform/System.h"
 
@@ -44,6 +45,11 @@ class JournalStore {
   static std::variant<std::unique_ptr<JournalStore>, PlatformError> open(
       const std::optional<std::string>& path, TimeRange range, FieldTokenizer& tokenizer,
       const StopFlag& stop, ServiceStatus* status = nullptr);
+
+  // A store of one export stream, from a file, pipe or socket that is read forward. `name` is what
+  // the report calls it. All references must outlive the store.
+  static std::unique_ptr<JournalStore> ofExport(UniqueFd stream, std::string name, TimeRange range,
+                                                FieldTokenizer& tokenizer, const StopFlag& stop);
 
   ~JournalStore();
   JournalStore(const JournalStore&) = delete;

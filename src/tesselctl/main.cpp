@@ -11,6 +11,9 @@ namespace tessel::ctl {
 
 namespace {
 
+// The completion of the shell asks with this. It is for nobody else, so --help does not name it.
+constexpr std::string_view kComplete = "--complete";
+
 constexpr const char* kFooter =
     "Exit status: 0 done; 1 the answer is bad; 2 usage; 4 no access.\n"
     "'tesselctl COMMAND --help' says more about a command.";
@@ -42,21 +45,19 @@ std::optional<std::vector<std::string>> takeCommand(std::vector<std::string>& ar
 // The parser reports --help and --version as errors of status 0. Its other statuses are numbers of
 // its own, and a script knows only ours. It would write to the streams of C++, which report no full
 // disk and escape nothing that the command line holds. So it writes to a string, and we print that.
-int end(const CLI::App& app, const CLI::ParseError& error) {
+int end(const CLI::App& app, const CLI::ParseError& error, const std::string& firstWord) {
   std::ostringstream out;
   std::ostringstream complaint;
   if (app.exit(error, out, complaint) == 0) {
     print(out.str());
     return kDone;
   }
-  const auto called = app.get_subcommands();
-  const std::string command = called.empty() ? "" : called.front()->get_name() + " ";
-  return fail(kUsage, std::string(error.what()) + "; see tesselctl " + command + "--help");
+  return failToParse(app, error, firstWord);
 }
 
 int run(std::vector<std::string> arguments) {
   Invocation invocation;
-  invocation.command = takeCommand(arguments);
+  if (arguments.empty() || arguments[0] != kComplete) invocation.command = takeCommand(arguments);
   CLI::App app("Records trace points and shows what tessel_reporter makes of them.", "tesselctl");
   app.require_subcommand(1);
   app.footer(kFooter);
@@ -72,20 +73,17 @@ int run(std::vector<std::string> arguments) {
   addReportCommand(app, invocation);
   addColourOption(app, invocation);
   app.set_version_flag("--version", "tesselctl " TESSEL_VERSION, "Print the version");
-  // The parser would only say that a subcommand is missing. We name the word that is wrong.
-  if (!arguments.empty() && !arguments[0].starts_with('-') &&
-      app.get_subcommands([&](CLI::App* known) { return known->check_name(arguments[0]); })
-          .empty()) {
-    return fail(kUsage, "there is no command '" + arguments[0] + "'; see tesselctl --help");
+  if (!arguments.empty() && arguments[0] == kComplete) {
+    arguments.erase(arguments.begin());
+    return complete(app, arguments);
   }
+  refuseValuesOfFlags(app);
+  const std::string firstWord = arguments.empty() ? "" : arguments[0];
   std::reverse(arguments.begin(), arguments.end());  // the parser takes words from the end
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& error) {
-    if (app.get_subcommands().empty() && !app.remaining().empty()) {
-      return fail(kUsage, "no command is called '" + app.remaining().front() + "'; see --help");
-    }
-    return end(app, error);
+    return end(app, error, firstWord);
   }
   return invocation.status;
 }

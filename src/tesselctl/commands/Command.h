@@ -69,6 +69,29 @@ struct CommandText {
 // Adds --color. `invocation` must outlive `app`.
 void addColourOption(CLI::App& app, Invocation& invocation);
 
+// Refuses each value of the option that is not one of `words`, and names them. The completion
+// offers them.
+CLI::Option* takesOneOf(CLI::Option* option, const std::vector<std::string>& words);
+// Refuses what is no whole number of `unit`, such as "rows", between the two.
+CLI::Option* takesWhole(CLI::Option* option, uint64_t least, uint64_t most,
+                        const std::string& unit);
+// Lets the completion offer `words`. Other values are taken as well.
+CLI::Option* suggests(CLI::Option* option, const std::vector<std::string>& words);
+// Lets the completion offer the names of files, and refuses an empty value.
+CLI::Option* suggestsFiles(CLI::Option* option);
+// The options and arguments that the parser takes behind `command`: its own, and options of the
+// commands around it as long as one lets them fall through to the next.
+std::vector<const CLI::Option*> optionsOf(const CLI::App& command);
+// What the option takes, as the completion offers it; empty where it may be anything.
+std::vector<std::string> valuesOf(const CLI::Option& option);
+// Makes the parser refuse --json=no, which it would take for --json.
+void refuseValuesOfFlags(CLI::App& app);
+// What the completion prints for the names of files.
+inline constexpr std::string_view kFiles = "FILES";
+// Prints what may stand in place of the last of `words`, which are the arguments of a command line
+// up to the cursor: a word a line, or kFiles alone. Returns the status.
+int complete(CLI::App& app, const std::vector<std::string>& words);
+
 // A subcommand, and the options that the parser fills in. The subcommand owns the options.
 template <typename Options>
 struct AddedCommand {
@@ -123,6 +146,8 @@ std::optional<Reading> readingOf(const ReadingOptions& options, const Surroundin
 std::optional<PlatformError> readWithProgress(DryRun& run, const Period& period, bool shown = true,
                                               double begin = 0, double end = 1);
 
+// The names of all platforms.
+std::vector<std::string> platformWords();
 // The platform of that name; absent if there is none.
 std::optional<TesselReporterPlatform> platformNamed(const std::string& name);
 
@@ -131,6 +156,8 @@ std::optional<TesselReporterPlatform> platformNamed(const std::string& name);
 
 // "tesselctl: message".
 int fail(ExitStatus status, const std::string& message);
+// The command line, which begins with `firstWord`, makes no sense to the parser.
+int failToParse(const CLI::App& app, const CLI::ParseError& error, const std::string& firstWord);
 // A trace store cannot be read.
 int failToRead(const PlatformError& error, const std::optional<std::string>& store);
 // A file cannot be written.

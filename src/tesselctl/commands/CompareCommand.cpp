@@ -2,6 +2,7 @@
 // what became slower from one period to the next.
 
 #include <algorithm>
+#include <set>
 
 #include "platform/Text.h"
 #include "tesselctl/commands/Comparison.h"
@@ -24,14 +25,23 @@ struct CompareOptions {
 std::optional<Setting> settingOf(const std::string& words, const Reading& usual, Date now) {
   Setting setting{usual.machine, usual.period};
   PeriodArguments period;
+  std::set<std::string> given;  // what was set, so that a second word for it is a mistake
   for (size_t begin = 0; begin <= words.size();) {
     const size_t end = std::min(words.find(',', begin), words.size());
     const std::string word = words.substr(begin, end - begin);
     begin = end + 1;
     if (word == "usual") continue;
+    const auto platform = platformNamed(word);
+    const std::string what = platform                     ? "platform"
+                             : word.ends_with("internal") ? "internal"
+                                                          : word.substr(0, word.find('='));
+    if (!given.insert(what).second) {
+      fail(kUsage, "setting '" + words + "': '" + word + "' contradicts a word before it");
+      return {};
+    }
     if (word == "internal" || word == "no-internal") {
       setting.machine.internal = word == "internal";
-    } else if (const auto platform = platformNamed(word)) {
+    } else if (platform) {
       setting.machine.platform = *platform;
     } else if (word.starts_with("since=")) {
       period.since = word.substr(6);
@@ -152,6 +162,12 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   const auto b = a ? settingOf(options.settings[1], *reading, surroundings.now) : std::nullopt;
   if (!b) return kUsage;
   const Setting settings[2] = {*a, *b};
+  const bool samePeriod = a->period.start == b->period.start && a->period.end == b->period.end;
+  if (!samePeriod && reading->store == kStandardInput) {
+    return fail(kUsage,
+                "--store: '-' can be read once, and each of two periods needs a reading: keep the "
+                "entries in a file, with journalctl -o export > FILE.export");
+  }
   const Comparison comparison = compared(settings, reading->store);
   if (comparison.error) return failToRead(*comparison.error, reading->store);
   print(options.json ? comparisonJson(comparison)
@@ -178,8 +194,19 @@ const CommandText kCompare{
 
 void addCompareCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, kCompare, runCompare);
-  command.add_option("A", options.settings[0], "Setting to start from")->required()->type_name("");
-  command.add_option("B", options.settings[1], "Setting to compare with it")
+  std::vector<std::string> words = {"usual", "internal", "no-internal"};
+  const std::vector<std::string> platforms = platformWords();
+  words.insert(words.end(), platforms.begin(), platforms.end());
+  for (const char* period : {"since=", "until=", "last="}) words.emplace_back(period);
+  suggests(command.add_option("A", options.settings[0],
+                              "Setting to start from: usual, internal, no-internal, a platform, "
+                              "since=DATE, until=DATE, last=DURATION; several with commas between"),
+           words)
+      ->required()
+      ->type_name("");
+  suggests(
+      command.add_option("B", options.settings[1], "Setting to compare with it, of the same words"),
+      words)
       ->required()
       ->type_name("");
   addPeriodOptions(command, options.reading);

@@ -20,7 +20,8 @@ void takeReading(const DryRun& run, Comparison& comparison) {
   std::vector<FileReport>& refused = comparison.unread.files;
   for (const FileReport& file : read.files) {
     const auto same = [&](const FileReport& other) { return other.path == file.path; };
-    if (file.refused && std::ranges::none_of(refused, same)) refused.push_back(file);
+    const bool wanted = file.refused || file.path == kStandardInputName;
+    if (wanted && std::ranges::none_of(refused, same)) refused.push_back(file);
   }
 }
 

@@ -6,6 +6,7 @@
 #include <charconv>
 #include <chrono>
 #include <deque>
+#include <filesystem>
 #include <thread>
 #include <utility>
 
@@ -75,6 +76,7 @@ class EventsRun {
             const Surroundings& surroundings)
       : options_(options),
         selection_(options, period),
+        stateDirectory_(surroundings.launch.stateDirectory),
         spool_(surroundings.launch.stateDirectory),
         terminal_(surroundings.terminal) {}
 
@@ -84,6 +86,8 @@ class EventsRun {
     if (state == SpoolReader::State::absent && options_.follow) {
       printError("There is no spool yet: nothing was sent. Waiting for " +
                  terminalText(spool_.path()) + ".\n");
+    } else if (state == SpoolReader::State::absent) {
+      return nothingSent();
     } else if (state != SpoolReader::State::open) {
       return complain(state);
     } else if (!show()) {
@@ -117,6 +121,20 @@ class EventsRun {
     flushOutput();
   }
 
+  // That no row is there is an answer, and no failure. Where the state directory is something else,
+  // we do not know.
+  int nothingSent() const {
+    std::error_code error;
+    const auto kind = std::filesystem::status(stateDirectory_, error).type();
+    if (kind != std::filesystem::file_type::directory &&
+        kind != std::filesystem::file_type::not_found)
+      return fail(kBad, stateDirectory_ + " is no directory; TESSEL_STATE_DIR names the state " +
+                            "directory of the service");
+    printError("Nothing was sent, or TESSEL_STATE_DIR names another place: there is no spool at " +
+               terminalText(spool_.path()) + ".\n");
+    return kDone;
+  }
+
   std::string heldIds() {
     const auto ids = spool_.ids();
     return ids ? "its ids go from " + std::to_string(ids->first) + " to " +
@@ -130,14 +148,13 @@ class EventsRun {
         return fail(kBad, "there is no spool at " + spool_.path() +
                               ": nothing was sent, or TESSEL_STATE_DIR names another place");
       case SpoolReader::State::noAccess:
-        fail(kNoAccess, spool_.reason());
-        printError("Run tesselctl as root, or as the user that the service runs as.\n");
-        return kNoAccess;
+        return fail(
+            kNoAccess,
+            spool_.reason() + "; run tesselctl as root, or as the user that the service runs as");
       default:
         if (!spool_.damaged()) return fail(kBad, "the spool cannot be read: " + spool_.reason());
-        fail(kBad, "the spool is damaged: " + spool_.reason());
-        printError("The service sets it aside in its next run and begins a new one.\n");
-        return kBad;
+        return fail(kBad, "the spool is damaged: " + spool_.reason() +
+                              "; the service sets it aside in its next run and begins a new one");
     }
   }
 
@@ -183,6 +200,7 @@ class EventsRun {
 
   const EventsOptions& options_;
   const RowSelection selection_;
+  const std::string stateDirectory_;
   SpoolReader spool_;
   const Terminal& terminal_;
   bool followed_ = false;
@@ -212,17 +230,13 @@ int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
     if (!result.period) return fail(kUsage, result.error);
     period = result.period;
     // Without --until a period ends now. Every row that --follow waits for would lie behind it.
-    if (options.follow && options.period.until.empty()) period->end = Date::max();
+    if (options.follow && !options.period.until) period->end = Date::max();
   }
   return EventsRun(options, period, surroundings).list();
 }
 
-// Zero would mean all rows, and a negative number a great many.
-std::string whyNoCount(const std::string& text) {
-  const bool digits = text.find_first_not_of("0123456789") == std::string::npos;
-  if (digits && text.find_first_not_of('0') != std::string::npos) return {};
-  return "'" + text + "' is no number of rows; the least is 1";
-}
+// Rows that -n asks for are kept in memory. Nobody reads more.
+constexpr uint64_t kMostRows = 1'000'000;
 
 const CommandText kEvents{
     "events", "Show what the spool holds, newest last",
@@ -245,18 +259,25 @@ const CommandText kEvents{
 
 void addEventsCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, kEvents, runEvents);
-  command.add_option("--since", options.period.since,
-                     "Only events sent since then; see 'tesselctl explain --help'");
-  command.add_option("--until", options.period.until, "Only events sent before then");
-  command.add_option("--last", options.period.last,
-                     "Only events of this length of time: 30m, 24h, 7d");
+  command
+      .add_option("--since", options.period.since,
+                  "Only events sent since then: 2026-11-22, '2026-11-22 21:45 CET', 21:45, "
+                  "yesterday, monday, -24h, '2 hours ago'")
+      ->type_name("DATE");
+  command
+      .add_option("--until", options.period.until,
+                  "Only events sent before then, in the same forms")
+      ->type_name("DATE");
+  command
+      .add_option("--last", options.period.last, "Only events of this length of time: 30m, 24h, 7d")
+      ->type_name("DURATION");
   addPatterns(command, "--name", options.names, "Only events of this name; may be repeated");
   addPatterns(command, "--subsystem", options.subsystems,
               "Only payloads of this subsystem; may be repeated");
   addPatterns(command, "--category", options.categories,
               "Only payloads of this category; may be repeated");
-  command.add_option("-n,--newest", options.newest, "Only so many, the newest")
-      ->check(whyNoCount)
+  takesWhole(command.add_option("-n,--newest", options.newest, "Only so many, the newest"), 1,
+             kMostRows, "rows")
       ->type_name("COUNT");
   auto* const sent = command.add_flag(
       "--sent", options.sent,
@@ -269,8 +290,8 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
   show->add_option("ID", options.id, "The id of the row, as 'tesselctl events' shows it")
       ->required()
       ->type_name("");
-  show->footer("The options are those of 'tesselctl events'; only --json and --color go with it.");
-  show->fallthrough();
+  show->add_flag("--json", options.json, "One JSON object: id, time, name, payload");
+  addColourOption(*show, invocation);
   command.require_subcommand(0, 1);
 }
 

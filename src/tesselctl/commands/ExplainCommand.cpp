@@ -167,6 +167,12 @@ int runExplain(const ExplainOptions& options, const Surroundings& surroundings) 
         kUsage,
         "--follow shows what is recorded from now on; it goes with neither --summary nor a period");
   }
+  if (options.follow && reading->store == kStandardInput) {
+    return fail(
+        kUsage,
+        "--follow looks for new entries in files; --store - reads standard input to its end "
+        "without --follow");
+  }
   return ExplainRun(options, *reading, surroundings).explain();
 }
 
@@ -190,9 +196,10 @@ CommandText explainText() {
           kNotes + wrapped(verdicts + ".", kFooterWidth, 0) + kExamples};
 }
 
-std::string whyNoVerdict(const std::string& name) {
-  const bool known = std::ranges::count(kVerdictOrder, name, verdictName) != 0;
-  return known ? "" : "'" + terminalText(name) + "' is no verdict";
+std::vector<std::string> verdictWords() {
+  std::vector<std::string> words;
+  for (const auto verdict : kVerdictOrder) words.emplace_back(verdictName(verdict));
+  return words;
 }
 
 }  // namespace
@@ -205,11 +212,14 @@ void addExplainCommand(CLI::App& app, Invocation& invocation) {
               "Only trace points of this subsystem; may be repeated");
   addPatterns(command, "--category", options.categories, "Only of this category; may be repeated");
   addPatterns(command, "--name", options.names, "Only of this name; may be repeated");
-  addPatterns(command, "--verdict", options.verdicts, "Only with this verdict; may be repeated")
-      ->type_name("VERDICT")
-      ->check(whyNoVerdict);
-  command.add_flag("--payload", options.payload, "Show the payload of what would be sent");
-  command.add_flag("--summary", options.summary, "Show figures instead of trace points");
+  takesOneOf(addPatterns(command, "--verdict", options.verdicts,
+                         "Only with this verdict; may be repeated"),
+             verdictWords())
+      ->type_name("VERDICT");
+  auto* const payload =
+      command.add_flag("--payload", options.payload, "Show the payload of what would be sent");
+  command.add_flag("--summary", options.summary, "Show figures instead of trace points")
+      ->excludes(payload);
   command.add_flag("--follow", options.follow, "Go on with what is recorded from now on");
   command.add_flag("--json", options.json, "One JSON object a line; with --summary one object");
 }

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <charconv>
 #include <csignal>
 #include <memory>
 
@@ -83,7 +84,8 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
   if (options.boot) {
     const auto boot = parseId128(*options.boot);
     if (!boot)
-      return Failure{kUsage, "'" + *options.boot + "' is no boot id: 32 hexadecimal digits"};
+      return Failure{kUsage,
+                     "--boot: '" + *options.boot + "' is no boot id: 32 hexadecimal digits"};
     origin.boot = *boot;
   }
   // Nobody knows when a made-up boot began. We let it begin in 1970: distances within it are right,
@@ -92,7 +94,9 @@ std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
                                             : options.boot    ? std::optional(origin.realtime)
                                                            : movedMonotonic(now, origin.realtime);
   if (!monotonic) {
-    return Failure{kUsage, "the time is before this machine's boot: give --boot, or --monotonic"};
+    return Failure{kUsage,
+                   "the time is before this machine's boot: give --boot with 32 hexadecimal "
+                   "digits, or --monotonic"};
   }
   origin.monotonic = *monotonic;
   if (options.imagePath) origin.imagePath = options.imagePath;
@@ -206,9 +210,9 @@ void addPointOptions(CLI::App& app, RecordedPoint& point) {
       ->type_name("RATE");
   app.add_option("--id", point.id, "Which begin an end belongs to, where several are open")
       ->type_name("ID");
-  app.add_option("--scope", point.scope, "Whether begin and end come from one process")
-      ->check(
-          CLI::IsMember(std::vector<std::string>(std::begin(kScopeWords), std::end(kScopeWords))));
+  takesOneOf(app.add_option("--scope", point.scope, "Whether begin and end come from one process"),
+             {std::begin(kScopeWords), std::end(kScopeWords)})
+      ->type_name("SCOPE");
   app.add_option("--attribute", point.attributes, "Attribute of an interval; may be repeated")
       ->type_name("KEY=VALUE")
       ->allow_extra_args(false);
@@ -220,28 +224,50 @@ void addPointOptions(CLI::App& app, RecordedPoint& point) {
       ->type_name("TEXT");
 }
 
+// The last microsecond of the year 9999, the last one that four digits can show.
+constexpr uint64_t kLatest = 253'402'300'799'999'999;
+
+// Before 1970 no entry has a time, and every machine is younger than this many seconds.
+std::string whyNotAgo(const std::string& text) {
+  constexpr double kMost = 1e9;
+  double seconds = -1;
+  const char* end = text.data() + text.size();
+  const auto [stop, error] = std::from_chars(text.data(), end, seconds, std::chars_format::fixed);
+  if (error == std::errc() && stop == end && seconds >= 0 && seconds <= kMost) return {};
+  return "'" + text + "' is no number of seconds from 0 to 1000000000";
+}
+
+std::string whyNoProcess(const std::string& text) {
+  if (text.size() <= 10 && text.find_first_not_of("0123456789") == std::string::npos) return {};
+  return "'" + text + "' is no id of a process: digits, or nothing";
+}
+
 void addStoreOptions(CLI::App& app, RecordOptions& options) {
   const std::string group = "With --store, in place of what is true";
   OriginOptions& origin = options.origin;
   auto* store =
-      app.add_option(
-             "--store", options.store,
-             "Append to an .export file in this directory, which must exist, instead of the "
-             "journal; for machines without a journal, and for trying things out")
+      suggestsFiles(
+          app.add_option(
+              "--store", options.store,
+              "Append to an .export file in this directory, which must exist, instead of the "
+              "journal; for machines without a journal, and for trying things out"))
           ->type_name("DIR");
   // To the journal, the daemon itself gives these facts, and nobody can replace them.
   const auto add = [&](const char* name, auto& value, const char* type, const char* help) {
     return app.add_option(name, value, help)->type_name(type)->group(group)->needs(store);
   };
   auto* at = add("--at", origin.at, "MICROSECONDS", "Time of the entry, since 1970");
-  add("--ago", origin.ago, "SECONDS", "Time of the entry, before now")
+  takesWhole(at, 0, kLatest, "microseconds");
+  add("--ago", origin.ago, "SECONDS", "Time of the entry, before now; before boot with --boot")
       ->excludes(at)
-      ->check(CLI::NonNegativeNumber);
-  add("--monotonic", origin.monotonic, "MICROSECONDS", "Time of the entry, since boot");
+      ->check(whyNotAgo);
+  takesWhole(add("--monotonic", origin.monotonic, "MICROSECONDS", "Time of the entry, since boot"),
+             0, kLatest, "microseconds");
   add("--boot", origin.boot, "ID", "Boot, 32 hexadecimal digits");
   add("--exe", origin.imagePath, "PATH", "Executable of the writer; empty: not known");
   add("--comm", origin.processName, "NAME", "Name of the writing process; empty: not known");
-  add("--pid", origin.process, "PID", "Id of the writing process; empty: not known");
+  add("--pid", origin.process, "PID", "Id of the writing process; empty: not known")
+      ->check(whyNoProcess);
 }
 
 void addKind(CLI::App& app, Invocation& invocation, RecordOptions& options, const std::string& kind,

@@ -144,11 +144,11 @@ std::optional<Labelled> labelledFrom(const std::string& text) {
 void addSlotOptions(CLI::App& app, const std::string& name,
                     std::span<std::optional<Labelled>> slots, const std::string& what) {
   for (size_t slot = 0; slot < slots.size(); ++slot) {
-    const auto take = [&labelled = slots[slot]](const std::string& text) {
-      labelled = labelledFrom(text);
-      if (!labelled) throw CLI::ValidationError("'" + text + "' is not LABEL=VALUE");
-    };
     const std::string number = std::to_string(slot + 1);
+    const auto take = [&labelled = slots[slot], option = name + number](const std::string& text) {
+      labelled = labelledFrom(text);
+      if (!labelled) throw CLI::ValidationError(option, "'" + text + "' is not LABEL=VALUE");
+    };
     app.add_option_function<std::string>(name + number, take, what + " " + number)
         ->type_name("LABEL=VALUE");
   }

@@ -57,11 +57,12 @@ int makeReport(const ReportOptions& options, const Reading& reading, const Repor
 }
 
 int runReport(const ReportOptions& options, const Surroundings& surroundings) {
-  if (options.html.empty()) return fail(kUsage, "--html names no file");
   auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   ReportFacts facts{machineName(),
-                    reading->store.value_or("the journal of this machine"),
+                    reading->store == kStandardInput
+                        ? std::string(kStandardInputName)
+                        : reading->store.value_or("the journal of this machine"),
                     std::string(nameForPlatform(reading->machine.platform)),
                     reading->machine.internal,
                     surroundings.now,
@@ -95,7 +96,7 @@ const CommandText kReport{"report", "Make a page about what was recorded, report
 
 void addReportCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, kReport, runReport);
-  command.add_option("--html", options.html, "File to write, - for standard output")
+  suggestsFiles(command.add_option("--html", options.html, "File to write, - for standard output"))
       ->required()
       ->type_name("FILE");
   command.add_flag("--last-run", options.lastRun,

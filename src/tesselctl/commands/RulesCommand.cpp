@@ -187,8 +187,7 @@ void addRulesCommand(CLI::App& app, Invocation& invocation) {
       command.add_subcommand("check", "Say whether a value or trace point would pass");
   check
       ->add_option("WORDS", options.words,
-                   "A value of a labelled string; or subsystem, category and name of a marked "
-                   "trace point")
+                   "VALUE of a labelled string; or SUBSYSTEM CATEGORY NAME of a marked trace point")
       ->required()
       ->expected(1, 3)
       ->type_name("");

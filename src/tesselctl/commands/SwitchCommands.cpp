@@ -45,9 +45,10 @@ void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, c
   command->add_flag("--json", options->json, json);
   addColourOption(*command, invocation);
   command->require_subcommand(1);
-  command->fallthrough();
-  for (const auto& [name, description, take] : positions)
-    setAction(*command->add_subcommand(name, description), invocation, options, take);
+  for (const auto& [name, description, take] : positions) {
+    CLI::App* position = command->add_subcommand(name, description);
+    setAction(*position->fallthrough(), invocation, options, take);
+  }
 }
 
 std::string deferFile(const Surroundings& surroundings) {

@@ -8,13 +8,18 @@
 
 #include "tesselctl/reading/DryRun.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
 #include <filesystem>
 #include <thread>
 #include <unordered_map>
 #include <utility>
 
 #include "linux/SystemFacts.h"
+#include "os/Files.h"
 
 namespace tessel::ctl {
 
@@ -147,9 +152,20 @@ DryRun::DryRun(std::optional<std::string> store, Visitor visitor)
   extractor_.setBuildAnimationCompositeIntervalTimelines(false);
 }
 
+// The stream closes its descriptor at the end, so it gets one of its own.
+std::variant<std::unique_ptr<JournalStore>, PlatformError> DryRun::openStore(TimeRange range) {
+  if (store_ != kStandardInput)
+    return JournalStore::open(store_, range, extractor_.tokenizer(), extractor_.stopFlag());
+  UniqueFd input(::fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, 0));
+  if (!input.valid())
+    return PlatformError{codeOf(errno), std::string(kStandardInputName) + ": " + errorWords(errno)};
+  return JournalStore::ofExport(std::move(input), std::string(kStandardInputName), range,
+                                extractor_.tokenizer(), extractor_.stopFlag());
+}
+
 std::optional<PlatformError> DryRun::readOnce(TimeRange range,
                                               const std::function<void(EntryStream&)>& process) {
-  auto opened = JournalStore::open(store_, range, extractor_.tokenizer(), extractor_.stopFlag());
+  auto opened = openStore(range);
   if (auto* error = std::get_if<PlatformError>(&opened)) return std::move(*error);
   JournalStore& store = *std::get<std::unique_ptr<JournalStore>>(opened);
   process(store.entries());

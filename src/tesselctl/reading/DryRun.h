@@ -11,12 +11,18 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <variant>
 
 #include "journal/JournalStore.h"
 #include "tesselctl/reading/TimeArguments.h"
 #include "trace/JournalExtractor.h"
 
 namespace tessel::ctl {
+
+// The name of the store that is an export stream on standard input, and what users call it.
+inline constexpr std::string_view kStandardInput = "-";
+inline constexpr std::string_view kStandardInputName = "standard input";
 
 class DryRun {
  public:
@@ -27,7 +33,7 @@ class DryRun {
   // entries read. A store may be younger than the period, so the part counts from its oldest entry.
   using Progress = std::function<void(double part, uint64_t entriesRead)>;
 
-  // An absent store is the machine's own journal.
+  // An absent store is the machine's own journal. kStandardInput can be read once.
   explicit DryRun(std::optional<std::string> store, Visitor visitor);
 
   // Reads the entries of the period. Returns an error if the store cannot be opened.
@@ -45,6 +51,7 @@ class DryRun {
   ExtractionReport report() const { return extractor_.report(storeReport_); }
 
  private:
+  std::variant<std::unique_ptr<JournalStore>, PlatformError> openStore(TimeRange range);
   bool mayStillCome(const PlatformError& error) const;
   std::optional<PlatformError> readOnce(TimeRange range,
                                         const std::function<void(EntryStream&)>& process);

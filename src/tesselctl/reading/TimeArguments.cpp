@@ -156,28 +156,27 @@ std::string durationText(microseconds duration) {
 // --since sets the start. So --since and --last contradict each other, all else combines.
 PeriodResult periodOf(const PeriodArguments& arguments, Date now) {
   Period period{now - kDay, now};
-  if (!arguments.until.empty()) {
-    const auto until = parseDate(arguments.until, now);
-    if (!until.date) return wrong("--until", arguments.until, until.error);
+  if (arguments.until) {
+    const auto until = parseDate(*arguments.until, now);
+    if (!until.date) return wrong("--until", *arguments.until, until.error);
     period = {*until.date - kDay, *until.date};
   }
-  if (!arguments.last.empty()) {
-    const auto last = parseDuration(arguments.last);
+  if (arguments.last) {
+    const auto last = parseDuration(*arguments.last);
     if (!last)
-      return wrong("--last", arguments.last,
+      return wrong("--last", *arguments.last,
                    "is no duration; durations look like 30m, 24h, 7d or 1h30m");
     period.start = period.end - *last;
   }
-  if (!arguments.since.empty()) {
-    const auto since = parseDate(arguments.since, now);
-    if (!since.date) return wrong("--since", arguments.since, since.error);
-    if (!arguments.last.empty())
-      return wrong("--since", arguments.since, "cannot be combined with --last");
+  if (arguments.since) {
+    const auto since = parseDate(*arguments.since, now);
+    if (!since.date) return wrong("--since", *arguments.since, since.error);
+    if (arguments.last) return wrong("--since", *arguments.since, "cannot be combined with --last");
     period.start = *since.date;
   }
   if (period.start >= period.end) {
-    return wrong(arguments.since.empty() ? "--until" : "--since",
-                 arguments.since.empty() ? arguments.until : arguments.since,
+    return wrong(arguments.since ? "--since" : "--until",
+                 arguments.since ? *arguments.since : arguments.until.value_or(""),
                  "leaves an empty period: " + periodText(period));
   }
   return {period, {}};

@@ -49,13 +49,14 @@ struct Period {
 // "2026-11-22 21:45:01 to 2026-11-23 21:45:01 CET", with two zones where clocks changed between.
 std::string periodText(const Period& period);
 
-// The values of --since, --until and --last; empty if the option is not given.
+// The values of --since, --until and --last; absent if the option is not given. An empty value is a
+// mistake: a script gave a variable that is not set.
 struct PeriodArguments {
-  std::string since;
-  std::string until;
-  std::string last;
+  std::optional<std::string> since;
+  std::optional<std::string> until;
+  std::optional<std::string> last;
 
-  bool given() const { return !since.empty() || !until.empty() || !last.empty(); }
+  bool given() const { return since || until || last; }
 };
 
 struct PeriodResult {

@@ -167,12 +167,13 @@ TEST_F(TimeArgumentsTest, APeriodIsADayUnlessToldOtherwise) {
   ASSERT_TRUE(period({}));
   EXPECT_EQ(period({})->start, now - std::chrono::hours{24});
   EXPECT_EQ(period({})->end, now);
-  EXPECT_EQ(period({"", "-1h", ""})->length(), std::chrono::hours{24});
-  EXPECT_EQ(period({"", "-1h", "10m"})->start, now - std::chrono::minutes{70});
-  EXPECT_EQ(period({"-2h", "-1h", ""})->length(), std::chrono::hours{1});
-  EXPECT_FALSE(period({"-1h", "-1h", ""}));
-  EXPECT_FALSE(period({"-1h", "", "1h"}));
-  EXPECT_NE(periodOf({"so\x1bon", "", ""}, now).error.find("--since: 'so\\x1bon'"),
+  EXPECT_EQ(period({{}, "-1h", {}})->length(), std::chrono::hours{24});
+  EXPECT_EQ(period({{}, "-1h", "10m"})->start, now - std::chrono::minutes{70});
+  EXPECT_EQ(period({"-2h", "-1h", {}})->length(), std::chrono::hours{1});
+  EXPECT_FALSE(period({"-1h", "-1h", {}}));
+  EXPECT_FALSE(period({"-1h", {}, "1h"}));
+  EXPECT_FALSE(period({"", {}, {}}));
+  EXPECT_NE(periodOf({"so\x1bon", {}, {}}, now).error.find("--since: 'so\\x1bon'"),
             std::string::npos);
 }
 
