@@ -270,6 +270,7 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     settings.recordsPerSecond = static_cast<uint64_t>(*rate);
   }
   settings.sendInstanceId = variables.flag("TESSEL_FORWARD_INSTANCE_ID");
+  settings.sendHealth = variables.flag("TESSEL_FORWARD_HEALTH");
   if (variables.error()) return *variables.error();
   return settings;
 }

@@ -14,6 +14,7 @@
 //   TESSEL_FORWARD_RETRY       seconds until the first new attempt, at most         5
 //   TESSEL_FORWARD_ALLOW_HTTP  1: plain http to any host, not to loopback alone     unset
 //   TESSEL_FORWARD_INSTANCE_ID 1: say which machine, by an id made for this program unset
+//   TESSEL_FORWARD_HEALTH      1: send the event tessel.health                      unset
 
 #pragma once
 
@@ -45,6 +46,7 @@ struct ForwarderSettings {
   std::chrono::seconds interval{30};
   std::chrono::milliseconds retry{5000};
   bool sendInstanceId = false;
+  bool sendHealth = false;
 };
 
 // The error is the first variable with an invalid value. A missing endpoint is an error, too. An

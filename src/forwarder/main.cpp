@@ -15,6 +15,7 @@
 
 #include "forwarder/Collector.h"
 #include "forwarder/Forwarder.h"
+#include "forwarder/Health.h"
 #include "forwarder/Settings.h"
 #include "linux/LogSinks.h"
 #include "linux/ServiceRuntime.h"
@@ -133,6 +134,7 @@ class Service {
       : settings_(settings),
         stop_(stop),
         state_(launch.stateDirectory),
+        health_(launch.stateDirectory, state_),
         manager_(connectServiceManager(clock_)),
         encoder_(encoder),
         collector_(collector) {}
@@ -181,7 +183,12 @@ class Service {
     if (const SqliteStatus opened = state_.open(); opened.ok()) {
       Forwarder forwarder({state_, encoder_, collector_, clock_, *manager_, stop_, chance},
                           options);
+      // A record of a time when health was still wanted must not leave.
+      if (!settings_.sendHealth) health_.withdraw();
       outcome = forwarder.deliverAll();
+      // After the rows, so that the record tells what became of them.
+      const bool added = settings_.sendHealth && health_.look(clock_.now());
+      if (added && outcome == ForwarderOutcome::delivered) outcome = forwarder.deliverAll();
       words = complaint(outcome, forwarder.reason());
     } else {
       words = complaint(outcome, opened.reason);
@@ -195,6 +202,7 @@ class Service {
   Semaphore& stop_;
   SystemClock clock_;
   ForwarderState state_;
+  Health health_;
   std::unique_ptr<ServiceManager> manager_;
   const Encoder& encoder_;
   Collector& collector_;

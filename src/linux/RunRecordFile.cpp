@@ -177,6 +177,9 @@ void addNote(JsonWriter& json, const RunNote& note) {
   if (note.outcome) json.member("outcome", runOutcomeName(*note.outcome));
   json.member("boot", note.boot).member("boot_began", note.bootBegan);
   json.member("tasking_written", note.taskingWritten);
+  if (!note.sums) return;
+  json.member("inspected", note.sums->inspected).member("sent", note.sums->sent);
+  json.member("stored", note.sums->stored).member("refused", note.sums->refused);
 }
 
 RunNote noteFrom(const Json& json) {
@@ -189,11 +192,14 @@ RunNote noteFrom(const Json& json) {
   note.boot = json.at("boot").get<std::string>();
   if (json.contains("boot_began")) note.bootBegan = dateAt(json, "boot_began");
   if (json.contains("tasking_written")) note.taskingWritten = dateAt(json, "tasking_written");
+  if (json.contains("sent"))
+    note.sums = {countAt(json, "inspected"), countAt(json, "sent"), countAt(json, "stored"),
+                 countAt(json, "refused")};
   return note;
 }
 
 RunNote noteOf(const RunRecord& record) {
-  return {record.start, record.end, record.outcome, {}, {}, {}};
+  return {record.start, record.end, record.outcome, {}, {}, {}, record.sums()};
 }
 
 RunHistory historyFrom(const Json& json) {
@@ -206,6 +212,8 @@ RunHistory historyFrom(const Json& json) {
     // An older service kept no notes. Its record says as much of one run.
     history.runs.push_back(noteOf(*history.last));
   }
+  // Without the count, as an older service left it, the notes are all that we know of.
+  history.begun = std::max(json.value("runs_begun", uint64_t{0}), uint64_t{history.runs.size()});
   return history;
 }
 
@@ -220,6 +228,7 @@ std::optional<PlatformError> writeHistory(RunHistory history, const std::string&
   JsonWriter json(text, {.indent = 1});
   json.object([&] {
     if (history.last) addRecord(json, *history.last);
+    json.member("runs_begun", history.begun);
     json.array("runs", history.runs,
                [&](const RunNote& note) { json.object([&] { addNote(json, note); }); });
   });
@@ -243,7 +252,8 @@ std::optional<PlatformError> writeRunBegin(Date start, const std::string& taskin
                                            const std::string& stateDirectory) {
   RunHistory history = usableHistory(stateDirectory);
   const Boot boot = thisBoot();
-  history.runs.push_back({start, {}, {}, boot.id, boot.began, fileTime(taskingFile)});
+  history.runs.push_back({start, {}, {}, boot.id, boot.began, fileTime(taskingFile), {}});
+  ++history.begun;
   return writeHistory(std::move(history), stateDirectory);
 }
 
@@ -255,9 +265,11 @@ std::optional<PlatformError> writeRunRecord(const RunRecord& record,
   const auto begun = std::find_if(history.runs.rbegin(), history.runs.rend(),
                                   [&](const RunNote& note) { return note.start == record.start; });
   // The begin may not have been written, for want of room.
+  if (begun == history.runs.rend()) ++history.begun;
   RunNote& note = begun != history.runs.rend() ? *begun : history.runs.emplace_back(noteOf(record));
   note.end = record.end;
   note.outcome = record.outcome;
+  note.sums = record.sums();
   history.last = record;
   return writeHistory(std::move(history), stateDirectory);
 }

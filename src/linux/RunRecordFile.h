@@ -1,5 +1,5 @@
 // The past runs on disk: `<state>/last_run.json` holds the record of the last run, and the notes of
-// the last sixteen.
+// the last 32.
 //
 // Stateless; any thread.
 

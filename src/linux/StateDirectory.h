@@ -15,6 +15,10 @@
 
 namespace tessel {
 
+// What `tesselctl status --save` found, as JSON: a file of the directory's owner, which the
+// forwarder reads.
+inline constexpr char kSavedStatusName[] = "status.json";
+
 // Holds the right to run until it is destroyed or the process ends.
 class RunLock {
  public:
@@ -31,6 +35,7 @@ class RunLock {
 //                       it.
 //   scheduler-put-off   for how many seconds the machine has put off the run that is due: decimal,
 //                       and a line feed
+//   status.json         what `tesselctl status --save` found last
 //   defer               other programs make and remove it; while it exists, runs are deferred
 //
 // A file that the service reads here is a regular file of the directory's owner. Anything else

@@ -150,7 +150,7 @@ TEST(RunRecordTest, OneOfAnOlderServiceHasNoReading) {
   const auto record = readRunRecord(directory.path());
   ASSERT_TRUE(record);
   EXPECT_FALSE(record->reading);
-  const RunNote note{record->start, record->end, RunOutcome::completed, {}, {}, {}};
+  const RunNote note{record->start, record->end, RunOutcome::completed, {}, {}, {}, record->sums()};
   EXPECT_EQ(std::get<RunHistory>(readRunHistory(directory.path())).runs, std::vector{note});
   EXPECT_TRUE(record->objectsBalance() && record->rowsBalance());
 }
@@ -160,8 +160,14 @@ TEST(RunRecordTest, ItStaysSmallAndItsSumsStayWhole) {
   RunRecord record = mixedDay();
   record.failure = std::string(4096, '\x01');
   record.reading = hugeDay();
-  for (size_t at = 0; at < RunHistory::kMaxRuns; ++at)
-    ASSERT_FALSE(writeRunBegin(record.start, directory.path(), directory.path()));
+  for (size_t at = 0; at < RunHistory::kMaxRuns; ++at) {
+    RunRecord small = mixedDay();
+    small.start += std::chrono::hours{at};
+    small.outcome = RunOutcome::bailedOut;
+    small.inspected = small.rowsStored = small.rowsFailed.at(0).second = UINT64_MAX / 2;
+    ASSERT_FALSE(writeRunBegin(small.start, directory.path(), directory.path()));
+    ASSERT_FALSE(writeRunRecord(small, directory.path()));
+  }
   ASSERT_FALSE(writeRunRecord(record, directory.path()));
   EXPECT_LT(std::filesystem::file_size(directory.path("last_run.json")), size_t{1} << 17);
   const auto reread = readRunRecord(directory.path());

@@ -54,6 +54,16 @@ struct RowTotals {
   bool operator==(const RowTotals&) const = default;
 };
 
+// The sums of a run by which a receiver of its rows can check that it has all of them.
+struct RunSums {
+  uint64_t inspected = 0;  // trace objects
+  uint64_t sent = 0;       // rows handed to the spool
+  uint64_t stored = 0;     // of them: in the spool
+  uint64_t refused = 0;    // of them: not stored, whatever the reason
+
+  bool operator==(const RunSums&) const = default;
+};
+
 struct RunRecord {
   Date start{};
   Date end{};
@@ -97,6 +107,12 @@ struct RunRecord {
     return 2 * (reported() - unsendable) - unnamed + countEvents + 1;
   }
   bool rowsBalance() const { return rowsStored == rowsExpected(); }
+  RunSums sums() const {
+    uint64_t refused = 0;
+    for (const auto& [reason, count] : rowsFailed) refused += count;
+    // A run without books sends no row. The formula would still expect the row of the summary.
+    return {inspected, hasBooks() ? rowsExpected() : 0, rowsStored, refused};
+  }
   // Sets the totals from those of the run before.
   void addTotals(RowTotals before) {
     totals = std::move(before);
@@ -121,6 +137,8 @@ struct RunNote {
   std::optional<Date> bootBegan;
   // When the file that switches reporting on was written. Absent if there is none.
   std::optional<Date> taskingWritten;
+  // Absent while the run is under way, if it died, and in what an older service wrote.
+  std::optional<RunSums> sums;
 
   // Whether the run did what it is for. What an interrupted run has read, it has reported.
   bool reported() const {
@@ -130,10 +148,12 @@ struct RunNote {
 };
 
 struct RunHistory {
-  // Enough for a week of a machine on which each second run dies, and still a small file.
-  static constexpr size_t kMaxRuns = 16;
+  // A collector may be away for as long as rows wait for it, which is 30 days by default. The
+  // forwarder then still tells it of each daily run.
+  static constexpr size_t kMaxRuns = 32;
 
   std::vector<RunNote> runs;      // the last ones, oldest first
+  uint64_t begun = 0;             // runs that were ever noted: the number of the last one
   std::optional<RunRecord> last;  // of the last run that came to its end
 
   bool operator==(const RunHistory&) const = default;

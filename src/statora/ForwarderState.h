@@ -70,6 +70,8 @@ class ForwarderState {
   SqliteStatus flushLog() { return database_.flushLog(); }
   // About how many rows wait. It is the span of their ids, because counting would read the table.
   uint64_t waiting();
+  // For the ledger of health records. Valid until the next open().
+  SqliteDatabase& database() { return database_; }
 
   // The counters. The next acknowledgement or setting aside stores them.
   ForwarderCounters& counters() { return counters_; }
