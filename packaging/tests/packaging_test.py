@@ -222,5 +222,24 @@ class Texts(unittest.TestCase):
         self.assertEqual((result.returncode, result.stdout), (0, ""))
 
 
+class Installed(unittest.TestCase):
+    def test_what_is_installed_finds_its_programs(self):
+        with tempfile.TemporaryDirectory() as root:
+            environment = dict(os.environ, DESTDIR=root)
+            result = run("cmake", "--install", os.environ["TESSEL_BUILD"], "--prefix", "/opt/tessel", env=environment)
+            self.assertEqual(result.returncode, 0, result.stderr)
+            self.assertEqual(os.listdir(root), ["opt"])
+            prefix = os.path.join(root, "opt", "tessel")
+            units = glob.glob(os.path.join(prefix, "lib", "systemd", "system", "*.service"))
+            programs = [program for unit in units for program in settings(unit)["ExecStart"]]
+            self.assertGreaterEqual(len(programs), 1)
+            for manual in glob.glob(os.path.join(prefix, "share", "man", "man8", "*.8")):
+                with open(manual, encoding="utf-8") as page:
+                    programs += re.findall(r"(?m)^\.Nm (/\S+)$", page.read())
+            self.assertEqual(len(programs), 2 * len(units))
+            for program in programs:
+                self.assertTrue(os.access(root + program, os.X_OK), program)
+
+
 if __name__ == "__main__":
     unittest.main()
