@@ -142,6 +142,23 @@ class Messages(MachineTest):
             self.assertIn("Nothing was sent", result.errors)
 
 
+class Dates(MachineTest):
+    def test_what_journalctl_prints_is_taken(self):
+        path = self.machine.write_journal([point("event", "com.vantor.A", "B", at=at) for at in (-600, -300)])
+        day, clock = r"20\d\d-\d\d-\d\d", r"\d\d:\d\d:\d\d"
+        for zone in ("Europe/Berlin", "America/St_Johns"):
+            for form, date in (("short", rf"\w+ \d+ {clock}"), ("short-precise", rf"\w+ \d+ {clock}\.\d+"), ("short-full", rf"\w+ {day} {clock} \w+"),
+                               ("with-unit", rf"\w+ {day} {clock} \w+"), ("short-iso", rf"{day}T{clock}[+-]\d+"), ("verbose", rf"\w+ {day} {clock}\.\d+ \w+"),
+                               ("short-iso-precise", rf"{day}T{clock}\.\d+[+-]\d+"), ("short-unix", r"\d+\.\d+")):
+                printed = subprocess.run(["journalctl", "--file", path, "-q", "-o", form], capture_output=True, text=True, check=True,
+                                         env={**os.environ, "TZ": zone, "LC_ALL": "C"}).stdout
+                dates = re.findall(rf"(?m)^{date}(?= )", printed)
+                self.assertEqual(len(dates), 2, (form, printed))
+                for shown, since in zip((2, 1), dates):
+                    result = self.assert_clean(self.machine.ctl("explain", "--since", since, TZ=zone))
+                    self.assertEqual(len(result.out.splitlines()), shown, (zone, form, since))
+
+
 class StandardInput(MachineTest):
     def stream(self, count=3, at=-60):
         return b"".join(export_bytes([point("event", "com.vantor.A", "B", f"Point{i}", at=at + i / 1000) for i in range(count)], self.machine.now))

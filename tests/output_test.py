@@ -131,6 +131,11 @@ class Terminals(OutputTest):
             head = self.on_terminal("events", "-n", "3", TZ=zone, NO_COLOR="1")[1].splitlines()
             self.assertRegex(head[0], f"^First row: {stamp} {name}$")
             self.assertRegex(head[1], r"^ *\d+  \d\d-\d\d ")
+            period = f"{stamp} to {stamp} {name}"
+            for arguments, head in ((("status",), f"{stamp} {name}\n"), (("compare", "usual", "internal"), f"{period}\nA: usual\nB: internal\n"),
+                                    (("compare", "last=1h", "until=-1h"), f"A: last=1h, {period}\nB: until=-1h, {period}\n"),
+                                    (("report", "--html", "-"), rf"[\s\S]*<p>{period} &middot;[\s\S]*made this page on {stamp} {name} ")):
+                self.assertRegex(self.machine.ctl(*arguments, TZ=zone).out, "^" + head)
 
     def test_lines_fit_80_columns_and_the_terminal(self):
         for columns in (80, 60):

@@ -228,7 +228,10 @@ class NextRun(StatusTest):
         path = os.path.join(self.machine.root, "bus")
         address = {"TESSEL_STATE_DIR": None, "DBUS_SYSTEM_BUS_ADDRESS": "unix:path=" + path}
         self.assertEqual(self.status(**address)["next_run"], {"by": "nothing"}, "nobody answers")
-        self.assertRegex(self.call("tesselctl", "status", **address).out, r"Next run +unknown +tessel-reporter.timer is not")
+        self.assertRegex(self.call("tesselctl", "status", **address).out, r"Next run +unknown +no service manager answers")
+        Bus(path, 0)
+        self.assertRegex(self.call("tesselctl", "status", **address).out, r"Next run +unknown +tessel-reporter.timer is not active; 'systemctl")
+        os.unlink(path)
         at = int((time.time() + 7200) * 1e6)
         bus = Bus(path, at)
         self.assertEqual(self.status(**address)["next_run"], {"by": "timer", "at": at})

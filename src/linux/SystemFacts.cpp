@@ -82,7 +82,7 @@ std::string objectOf(const std::string& unit) {
 
 }  // namespace
 
-std::optional<Date> nextElapseOf(const std::string& timer) {
+TimerAnswer askTimer(const std::string& timer) {
   const Bus bus = systemBus();
   const std::string object = objectOf(timer);
   if (!bus || object.empty()) return {};
@@ -90,11 +90,10 @@ std::optional<Date> nextElapseOf(const std::string& timer) {
   uint64_t next = 0;  // microseconds since 1970; 0 or the greatest number: it does not elapse
   if (sd_bus_get_property_trivial(bus.get(), "org.freedesktop.systemd1", object.c_str(),
                                   "org.freedesktop.systemd1.Timer", "NextElapseUSecRealtime",
-                                  nullptr, 't', &next) < 0 ||
-      next == 0 || next > INT64_MAX) {
+                                  nullptr, 't', &next) < 0)
     return {};
-  }
-  return Date{std::chrono::microseconds{static_cast<int64_t>(next)}};
+  if (next == 0 || next > INT64_MAX) return {true, {}};
+  return {true, Date{std::chrono::microseconds{static_cast<int64_t>(next)}}};
 }
 
 namespace {

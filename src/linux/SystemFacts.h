@@ -35,9 +35,13 @@ struct Boot {
 };
 Boot thisBoot();
 
-// When the timer of the service manager elapses next. Absent if no service manager answers, or if
-// the timer is not active. Any thread.
-std::optional<Date> nextElapseOf(const std::string& timer);
+// What the service manager says about a timer.
+struct TimerAnswer {
+  bool answered = false;
+  std::optional<Date> next;  // when it elapses; absent if it is not active
+};
+// Waits up to a second for the answer. Any thread.
+TimerAnswer askTimer(const std::string& timer);
 
 // The value that the text of an os-release file gives `name`, without its quotes. Of several lines
 // the last counts, as for a shell that reads the file. Empty if there is none. Points into `text`.

@@ -116,7 +116,20 @@ std::string periodsText(const Comparison& comparison, const Terminal& terminal) 
   return out;
 }
 
-std::string comparisonText(const Comparison& comparison, const CompareOptions& options,
+// The period of both, or behind each setting its own.
+std::string comparisonHeading(const Setting (&settings)[2], const CompareOptions& options,
+                              const Terminal& terminal) {
+  const bool same = samePeriod(settings);
+  std::string out = same ? periodText(settings[0].period) + "\n" : "";
+  for (size_t side = 0; side < 2; ++side) {
+    std::string line = (side == 0 ? "A: " : "B: ") + terminalText(options.settings[side]);
+    if (!same) line += ", " + periodText(settings[side].period);
+    out += wrapped(line, terminal.width, 3) + "\n";
+  }
+  return out;
+}
+
+std::string comparisonText(const Comparison& comparison, const std::string& heading,
                            const Terminal& terminal) {
   Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
   for (const auto verdict : kVerdictOrder) {
@@ -136,9 +149,7 @@ std::string comparisonText(const Comparison& comparison, const CompareOptions& o
                    terminalText(change.name),
                rule});
   }
-  std::string out = "A: " + terminalText(options.settings[0]) +
-                    "\nB: " + terminalText(options.settings[1]) + "\n\n" +
-                    sums.render(terminal, 2) + "\n" +
+  std::string out = heading + "\n" + sums.render(terminal, 2) + "\n" +
                     wrapped("B would start to report " +
                                 counted(comparison.changes.starting(), "object", "objects") +
                                 " and stop to report " +
@@ -162,8 +173,7 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   const auto b = a ? settingOf(options.settings[1], *reading, surroundings.now) : std::nullopt;
   if (!b) return kUsage;
   const Setting settings[2] = {*a, *b};
-  const bool samePeriod = a->period.start == b->period.start && a->period.end == b->period.end;
-  if (!samePeriod && reading->store == kStandardInput) {
+  if (!samePeriod(settings) && reading->store == kStandardInput) {
     return fail(kUsage,
                 "--store: '-' can be read once, and each of two periods needs a reading: keep the "
                 "entries in a file, with journalctl -o export > FILE.export");
@@ -171,7 +181,9 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   const Comparison comparison = compared(settings, reading->store);
   if (comparison.error) return failToRead(*comparison.error, reading->store);
   print(options.json ? comparisonJson(comparison)
-                     : comparisonText(comparison, options, surroundings.terminal));
+                     : comparisonText(comparison,
+                                      comparisonHeading(settings, options, surroundings.terminal),
+                                      surroundings.terminal));
   flushOutput();
   return warnOfUnreadFiles(comparison.unread, reading->store);
 }

@@ -132,11 +132,14 @@ void comparePeriods(const Setting (&settings)[2], const std::optional<std::strin
 
 }  // namespace
 
-Comparison compared(const Setting (&settings)[2], const std::optional<std::string>& store) {
+bool samePeriod(const Setting (&settings)[2]) {
   const auto& [a, b] = settings;
-  const bool samePeriod = a.period.start == b.period.start && a.period.end == b.period.end;
+  return a.period.start == b.period.start && a.period.end == b.period.end;
+}
+
+Comparison compared(const Setting (&settings)[2], const std::optional<std::string>& store) {
   Comparison comparison;
-  (samePeriod ? compareJudges : comparePeriods)(settings, store, comparison);
+  (samePeriod(settings) ? compareJudges : comparePeriods)(settings, store, comparison);
   return comparison;
 }
 

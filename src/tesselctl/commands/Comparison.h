@@ -96,6 +96,7 @@ struct Comparison {
   Losses losses;       // of each reading
 };
 
+bool samePeriod(const Setting (&settings)[2]);
 // Reads the store once, or once for each period if they differ.
 Comparison compared(const Setting (&settings)[2], const std::optional<std::string>& store);
 

@@ -185,8 +185,9 @@ NextRun nextRunOf(const ReporterStatus& status, const LaunchConfiguration& launc
   }
   // The timer of the package starts runs on the state directory of the package.
   if (!status.ofPackage) return {};
-  if (const auto at = nextElapseOf(kTimer)) return {NextRun::By::timer, *at};
-  return {};
+  const TimerAnswer timer = askTimer(kTimer);
+  if (timer.next) return {NextRun::By::timer, timer.next};
+  return {NextRun::By::nothing, {}, timer.answered};
 }
 
 }  // namespace

@@ -53,8 +53,9 @@ struct JournalFacts {
 struct NextRun {
   enum class By { nothing, timer, interval, underWay };
 
-  By by = By::nothing;     // nothing: nobody knows what starts it
-  std::optional<Date> at;  // absent where nobody knows
+  By by = By::nothing;         // nothing: nobody knows what starts it
+  std::optional<Date> at;      // absent where nobody knows
+  bool timerInactive = false;  // the service manager says so; else it did not answer
 };
 // Names for JSON: "nothing", "timer", "interval", "under_way".
 std::string_view nextRunName(NextRun::By by);

@@ -193,7 +193,11 @@ std::string changeLines(const Style& style, const DurationChange& change,
     };
     figures += std::string(quantile.name) + " " + both(side(*change.a), side(*change.b)) + ", ";
   }
-  figures += both(grouped(change.a->count()), grouped(change.b->count())) + " values";
+  const auto values = [](const QuantileSketch& sketch) {
+    return counted(sketch.count(), "value", "values");
+  };
+  figures += change.verdict == Verdict::onlyA ? values(*change.a)
+                                              : both(grouped(change.a->count()), values(*change.b));
   const VerdictText& verdict = textOf(change.verdict);
   std::string label = verdict.text;
   if (change.verdict == Verdict::slower) label = threeDigits(change.factor) + "x slower";

@@ -186,7 +186,7 @@ std::string eventTotals(const SpoolContents& contents, const std::vector<Deliver
                     rows(contents.delivered) + " sent and still here\n";
   for (const Delivered& one : deliveries) {
     out += rows(one.rows) + " to " + terminalText(one.destination) + ", the last at " +
-           dateText(dateOf(one.last)) + "\n";
+           zonedText(dateOf(one.last)) + "\n";
   }
   if (contents.setAside != 0) {
     out += rows(contents.setAside) +

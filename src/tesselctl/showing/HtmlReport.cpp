@@ -240,8 +240,7 @@ std::string htmlReport(const Tally& tally, const ExtractionReport& report,
           "initial-scale=1\">\n<title>Trace points of "
        << machine << ", " << dateText(tally.period().end).substr(0, 10) << "</title>\n<style>"
        << kReportStyle << "</style>\n</head>\n<body>\n<header>\n<h1>Trace points of <bdi>"
-       << machine << "</bdi></h1>\n<p>" << dateText(tally.period().start) << " to "
-       << dateText(tally.period().end) << " &middot; "
+       << machine << "</bdi></h1>\n<p>" << periodText(tally.period()) << " &middot; "
        << (facts.run ? std::string_view("the last run") : std::string_view("a dry run"))
        << ", judged as on " << facts.platform
        << (facts.internal ? std::string_view(" with internal diagnostics") : std::string_view())
@@ -256,7 +255,7 @@ std::string htmlReport(const Tally& tally, const ExtractionReport& report,
   html << runSection(facts, names) << readingSection(report, facts, names)
        << LossSection(report.store.reading, "What was lost", "", facts, names).html()
        << namesNote(names) << "</main>\n<footer>tesselctl made this page on "
-       << dateText(facts.made) << " and sent it nowhere.";
+       << zonedText(facts.made) << " and sent it nowhere.";
   if (facts.withoutValues)
     html << " Recorded values, users, programs, paths and the machine's name are left out.";
   html << "</footer>\n<script>" << kReportScript << "</script>\n</body>\n</html>\n";

@@ -20,6 +20,8 @@ class Screen {
         store_(status.store.value_or("the journal of this machine")) {}
 
   std::string render() {
+    // The dates below are of this zone.
+    out_ = zonedText(status_.now) + "\n";
     line("Tasking", status_.tasking.decision.on() ? "on" : "off",
          status_.tasking.decision.on() ? Colour::good : Colour::caution, status_.taskingWords);
     line("Deferral", status_.deferral ? "wanted" : "none",
@@ -116,8 +118,11 @@ class Screen {
         return;
       case NextRun::By::nothing:
         line("Next run", "unknown", status_.ofPackage ? Colour::caution : Colour::plain,
-             status_.ofPackage ? "tessel-reporter.timer is not active, or does not answer"
-                               : "no timer of the package serves this state directory");
+             !status_.ofPackage ? "no timer of the package serves this state directory"
+             : status_.nextRun.timerInactive
+                 ? "tessel-reporter.timer is not active; 'systemctl enable --now "
+                   "tessel-reporter.timer' starts it"
+                 : "no service manager answers, which would know of tessel-reporter.timer");
         return;
     }
   }
@@ -134,16 +139,18 @@ class Screen {
     }
     balance("Objects", run.objectsBalance(), sums);
     std::string rows =
-        grouped(run.rowsStored) + " rows stored, expected 2 x " + grouped(run.reported()) +
+        counted(run.rowsStored, "row", "rows") + " stored, expected 2 x " +
+        grouped(run.reported()) +
         (run.unnamed == 0 ? "" : " - " + grouped(run.unnamed) + " without a name") +
         (run.unsendable == 0 ? "" : " - 2 x " + grouped(run.unsendable) + " without a payload") +
         " + " + grouped(run.countEvents) + " counts + 1";
     if (!run.rowsBalance()) rows += " = " + grouped(run.rowsExpected());
     balance("Rows", run.rowsBalance(), rows);
     for (const auto& [reason, count] : run.rowsFailed) {
-      if (count != 0) more(grouped(count) + " rows failed: " + reason);
+      if (count != 0) more(counted(count, "row", "rows") + " failed: " + reason);
     }
-    if (run.rowsExpired != 0) more(grouped(run.rowsExpired) + " rows of earlier runs expired");
+    if (run.rowsExpired != 0)
+      more(counted(run.rowsExpired, "row", "rows") + " of earlier runs expired");
     for (const std::string& name : run.setAside) more("a damaged spool was set aside as " + name);
   }
   void balance(std::string_view what, bool balances, const std::string& words) {
@@ -219,7 +226,7 @@ class Screen {
       words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
                dateText(Date{std::chrono::microseconds{*spool.newest}});
     }
-    line("Spool", grouped(static_cast<uint64_t>(spool.rows)) + " rows", Colour::plain, words);
+    line("Spool", counted(static_cast<uint64_t>(spool.rows), "row", "rows"), Colour::plain, words);
   }
 
   void forwarder(const ForwarderCounters& counters) {

@@ -272,6 +272,10 @@ std::string ruleWords(const FilterDecision& decision, const std::string& scope,
   switch (decision.classification) {
     case TesselReporterClassificationFailedStringWhitelist:
       return whitelistWords(decision, terminal);
+    case TesselReporterClassificationTelemetryDisabled:
+      return "it is not marked for telemetry (TESSEL_TELEMETRY=1)";
+    case TesselReporterClassificationClassNotSupported:
+      return "its kind cannot be reported";
     case TesselReporterClassificationDurationThreshold:
       return "its duration is " + numberText(Number{decision.durationSeconds}) + " s";
     default:
