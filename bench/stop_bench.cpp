@@ -1,12 +1,13 @@
-// How long an extraction that is told to stop goes on: build/release/bin/stop_bench STORE. STORE is
-// a directory with journal or export files of the last 24 hours. It is read once as a whole, and
-// then a hundred times with a stop at a random moment.
+// How long an extraction that is told to stop goes on: build/release/bin/stop_bench STORE
+// [STOPS]. STORE is a directory with journal or export files of the last 24 hours. It is read once
+// as a whole, and then STOPS times (default: a hundred) with a stop at a random moment.
 
 #include <pthread.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <ctime>
 #include <future>
 #include <optional>
@@ -21,8 +22,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 using Milliseconds = std::chrono::duration<double, std::milli>;
-
-constexpr size_t kStops = 100;
 
 void readStore(tessel::JournalExtractor& extractor) {
   const auto now = std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
@@ -90,8 +89,9 @@ void print(const char* what, std::vector<Milliseconds> times) {
 }  // namespace
 
 int main(int count, char** arguments) {
-  if (count != 2) {
-    std::fputs("usage: stop_bench STORE\n", stderr);
+  const size_t stops = count == 3 ? std::strtoul(arguments[2], nullptr, 10) : 100;
+  if (count < 2 || count > 3 || stops == 0) {
+    std::fputs("usage: stop_bench STORE [STOPS]\n", stderr);
     return 64;
   }
   const std::string store = arguments[1];
@@ -99,7 +99,7 @@ int main(int count, char** arguments) {
   std::uniform_real_distribution<> moments(0, timeOfAll(store).count());
   std::vector<Milliseconds> times;
   std::vector<Milliseconds> processor;
-  for (int tries = 0; times.size() < kStops && tries < 1000; ++tries) {
+  for (int tries = 0; times.size() < stops && tries < 1000; ++tries) {
     const auto late = stopAfter(store, Milliseconds(moments(random)));
     if (!late) continue;
     times.push_back(late->time);

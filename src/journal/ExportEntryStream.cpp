@@ -109,9 +109,11 @@ ExportEntryStream::Outcome ExportEntryStream::finishEntry() {
   return Outcome::skipped;
 }
 
-// Reads up to the next newline; false if there is none yet. The bytes before `searched` hold no
-// newline, so we do not look at them again each time the window has grown.
+// Reads up to the next newline; false if there is none yet, or after a stop: an entry, and what
+// lies between two, may be as long as the file. The bytes before `searched` hold no newline, so we
+// do not look at them again each time the window has grown.
 bool ExportEntryStream::readLine(Line& line) {
+  if (stop_.load(std::memory_order_relaxed)) return false;
   for (size_t searched = 0; searched <= kLongLine; searched = window_.bytes().size()) {
     if (!window_.fill(searched + 1)) return false;
     const std::string_view bytes = window_.bytes();

@@ -20,14 +20,22 @@ constexpr FieldToken kDamaged = UINT32_MAX;
 // two calls if it is longer, and otherwise the kernel copies less.
 constexpr size_t kUsualText = 440;
 
-// Nanoseconds that it takes to decompress a value, and each byte of it before and after.
-constexpr uint64_t kXzValue = 10'000;
-constexpr uint64_t kXzByte = 20;
-constexpr uint64_t kOtherValue = 1000;
-// A file whose every value is compressed stays below 100 ns for each byte of the file. A small one
-// is allowed as much as one of half a megabyte.
+// Nanoseconds that it takes to read a value and each byte of it.
+constexpr uint64_t kValue = 500;
+constexpr uint64_t kByte = 1;
+// Nanoseconds that it takes to decompress a value, and for each byte of it before and after. XZ and
+// ZSTD take a few bytes for the tables of a block, which take microseconds to build.
+struct Decompression {
+  uint64_t value;
+  uint64_t byteBefore;
+  uint64_t byteAfter;
+};
+constexpr Decompression costOf(uint8_t compression) {
+  if (compression == kXz) return {10'000, 60, 20};
+  return {1000, compression == kZstd ? uint64_t{60} : kByte, kByte};
+}
+// A file whose every value is compressed stays below 100 ns for each byte of the file.
 constexpr uint64_t kAllowedPerByte = 200;
-constexpr uint64_t kAllowedBytes = 500'000;
 
 // Bytes from one item of an entry to the next.
 template <typename Item>
@@ -45,6 +53,7 @@ JournalEntryStream::JournalEntryStream(std::unique_ptr<JournalFile> file, uint32
       file_(*owned_),
       number_(number),
       context_(context),
+      allowed_(kAllowedPerByte * file_.file().size()),
       marks_(context.marks, context.resources.placesLeft),
       walk_(file_, marks_, context.report, context.stop) {}
 
@@ -65,6 +74,9 @@ bool JournalEntryStream::next() {
 void JournalEntryStream::checkTime() {
   constexpr uint64_t kMinute = 60'000'000;  // the clock may drift, and is set in small steps often
   const EntryHeader& entry = walk_.header();
+  const uint64_t first = file_.header().headRealtime;
+  if (walk_.entriesFound() == 1 && first != 0 && first != entry.realtime)
+    context_.report.addProblem("first entry with another time than the header", walk_.offset());
   const uint64_t difference = entry.realtime - entry.monotonic;
   const bool usual =
       difference - usualDifference_ + kMinute <= 2 * kMinute && sameId(entry.bootId, usualBoot_);
@@ -102,12 +114,23 @@ void JournalEntryStream::finish() {
         file_.file().wasCut() ? "cut short while it was read" : "not readable",
         file_.file().size());
   context_.report.addProblem("entries missing", file_.objectsEnd(), missing);
-  // The last entry has no later neighbour. The header of a closed file has its times instead.
-  if (walk_.entriesFound() != 0 &&
-      (walk_.header().realtime != file_.header().tailRealtime ||
-       walk_.header().monotonic != file_.header().tailMonotonic) &&
-      !file_.beingWritten())
+  if (walk_.entriesFound() != 0 && lastHasOtherTimes())
     context_.report.addProblem("last entry with other times than the header", walk_.offset());
+}
+
+// The last entry has no later neighbour. The header has its times instead. While a file is being
+// written, another entry may come at any moment. So we look again before we tell.
+bool JournalEntryStream::lastHasOtherTimes() {
+  const auto differs = [&](const JournalHeader& header) {
+    return walk_.header().realtime != header.tailRealtime ||
+           walk_.header().monotonic != header.tailMonotonic;
+  };
+  if (!file_.beingWritten()) return differs(file_.header());
+  for (int look = 0; look < 2; ++look) {
+    const auto now = file_.headerNow();
+    if (!now || now->entryCount != walk_.entriesFound() || !differs(*now)) return false;
+  }
+  return true;
 }
 
 Entry JournalEntryStream::entry() {
@@ -244,6 +267,11 @@ size_t JournalEntryStream::intactTokensOf(const uint8_t* items, size_t count) {
 
 // Reads a data object and shows it to the tokenizer.
 TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
+  if (const auto known = longTexts_.find(offset); known != longTexts_.end()) {
+    comparable_ = false;
+    if (longTextsGeneration_ == context_.tokenizer.generation()) return {known->second};
+    longTexts_.clear();
+  }
   DataObject data;
   const auto text = textAt(offset, data);
   const FieldToken token = text ? tokenOf(*text) : kDamaged;
@@ -254,8 +282,12 @@ TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
   }
   comparable_ = comparable_ && text->whole;
   const TokenCache::Value value{token, static_cast<uint32_t>(lookup3(text->head))};
-  // The hash of a part is no hash, so such a value must be met anew each time.
+  // The hash of a part is no hash, so the cache must not have it.
   if (text->whole && TokenCache::takes(offset)) remember(offset, data, value);
+  if (!text->whole && longTexts_.size() < kMaxLongTexts) {
+    longTexts_.emplace(offset, token);
+    longTextsGeneration_ = context_.tokenizer.generation();
+  }
   return value;
 }
 
@@ -276,16 +308,18 @@ void JournalEntryStream::remember(uint64_t offset, const DataObject& data,
 std::optional<JournalEntryStream::Text> JournalEntryStream::textAt(uint64_t offset,
                                                                    DataObject& data) {
   JournalReadResources& resources = context_.resources;
-  if (!file_.readData(offset, kUsualText, resources.data, data)) return std::nullopt;
+  if (!allows(kValue) || !file_.readData(offset, kUsualText, resources.data, data))
+    return std::nullopt;
   if (data.compression != 0) {
     const auto result = decompress(data, resources.text);
     if (!result || result->produced == 0) return std::nullopt;
     const auto head = std::span<const uint8_t>(resources.text).first(result->produced);
     return Text{head, head.size() + !result->complete, result->complete};
   }
-  if (!data.isWhole() &&
-      !file_.readData(offset, JournalReadResources::kLongestHashed, resources.data, data))
-    return std::nullopt;
+  const bool isLong = data.payloadSize > JournalReadResources::kLongestHashed;
+  const size_t needed = isLong ? kMaxFieldHead : JournalReadResources::kLongestHashed;
+  if (!data.isWhole() && !file_.readData(offset, needed, resources.data, data)) return std::nullopt;
+  allows(data.head.size() * kByte);
   return Text{data.head, data.payloadSize, data.isWhole()};
 }
 
@@ -298,11 +332,24 @@ FieldToken JournalEntryStream::tokenOf(const Text& text) {
 }
 
 // A file that was made to cost time can let thousands of data objects share the same bytes, each of
-// which takes long to decompress. So what the decompressing costs is estimated, and beyond the
-// allowance of the file all further compressed values count as damaged.
+// which takes long to decompress, and can name one far value in every four bytes. So what the
+// values cost is estimated. Beyond the allowance of the file all further ones count as damaged. The
+// counts are equal on every machine, so the report is, too.
+bool JournalEntryStream::allows(uint64_t nanoseconds) {
+  work_ += nanoseconds;
+  if (work_ <= allowed_) [[likely]]
+    return true;
+  uint64_t& spare = context_.resources.spareWork;
+  const uint64_t over = std::min(nanoseconds, work_ - allowed_);
+  const bool enough = over <= spare;
+  spare -= std::min(over, spare);
+  return enough;
+}
+
 std::optional<Decompressor::Result> JournalEntryStream::decompress(const DataObject& data,
                                                                    std::span<uint8_t> target) {
-  if (decompressing_ / kAllowedPerByte > kAllowedBytes + file_.file().size()) return std::nullopt;
+  const Decompression cost = costOf(data.compression);
+  if (!allows(cost.value)) return std::nullopt;
   uint64_t bytes = 0;
   const Decompressor::Source source = [&](uint64_t position, std::span<uint8_t> input) {
     const uint64_t left = data.payloadSize - std::min(position, data.payloadSize);
@@ -312,8 +359,7 @@ std::optional<Decompressor::Result> JournalEntryStream::decompress(const DataObj
     return stopped() ? 0 : got;
   };
   const auto result = context_.resources.decompressor.decompress(data.compression, source, target);
-  bytes += result ? result->produced : target.size();
-  decompressing_ += data.compression == kXz ? kXzValue + kXzByte * bytes : kOtherValue + bytes;
+  allows(bytes * cost.byteBefore + (result ? result->produced : target.size()) * cost.byteAfter);
   return result;
 }
 

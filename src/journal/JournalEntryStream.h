@@ -21,6 +21,7 @@
 #pragma once
 
 #include <array>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string_view>
@@ -50,6 +51,9 @@ struct JournalReadResources {
   std::array<uint8_t, kLongestHashed> text;
   std::array<FieldToken, JournalFile::kMaxItems> tokens;  // of the current entry
   size_t placesLeft = DataMarks::kTotal;
+  // Nanoseconds that the values of all files may take beyond what the size of each file allows. A
+  // small file may hold a value that unpacks to a thousand times its size.
+  uint64_t spareWork = 100'000'000;
 };
 
 class JournalEntryStream final : public EntryStream {
@@ -79,6 +83,7 @@ class JournalEntryStream final : public EntryStream {
 
   void checkTime();
   void finish();
+  bool lastHasOtherTimes();
   bool stopped() const { return context_.stop.load(std::memory_order_relaxed); }
   template <typename Item>
   size_t collectTokens();
@@ -94,19 +99,27 @@ class JournalEntryStream final : public EntryStream {
   void remember(uint64_t offset, const DataObject& data, TokenCache::Value value);
   std::optional<Text> textAt(uint64_t offset, DataObject& data);
   FieldToken tokenOf(const Text& text);
+  bool allows(uint64_t nanoseconds);
   std::optional<Decompressor::Result> decompress(const DataObject& data, std::span<uint8_t> target);
 
   const std::unique_ptr<JournalFile> owned_;
   JournalFile& file_;
   const uint32_t number_;
   Context context_;
+  const uint64_t allowed_;  // nanoseconds that the values of the file may take
+  uint64_t work_ = 0;       // that they took, estimated
   DataMarks marks_;
   EntryWalk walk_;
   // Boot and difference of the two clocks, as the entries before had them.
   Id128 usualBoot_{};
   uint64_t usualDifference_ = 0;
-  uint64_t unusualEntry_ = 0;   // offset of the last entry, if it differed from that; 0: it did not
-  uint64_t decompressing_ = 0;  // nanoseconds, estimated
+  uint64_t unusualEntry_ = 0;  // offset of the last entry, if it differed from that; 0: it did not
+  // The tokens of texts that are too long for the cache. A compressed one takes long to read, and
+  // all entries of a program may have it. A file that has more than 256 of them is read more
+  // slowly.
+  static constexpr size_t kMaxLongTexts = 256;
+  std::map<uint64_t, FieldToken> longTexts_;
+  uint32_t longTextsGeneration_ = 0;
   bool finished_ = false;
   bool comparable_ = true;  // the current entry can be compared with its hash
 };

@@ -80,12 +80,18 @@ JournalFile::JournalFile(UniqueFd fd, uint64_t size, const JournalHeader& header
       itemShift_(std::countr_zero(header.compact() ? kCompactEntryItemSize : kEntryItemSize)),
       dataHeaderSize_(header.compact() ? kCompactDataHeaderSize : kDataHeaderSize) {}
 
+std::optional<JournalHeader> JournalFile::headerNow() {
+  std::array<uint8_t, kMinHeaderSize> bytes;
+  if (file_.read(0, bytes) != bytes.size()) return std::nullopt;
+  auto parsed = parseJournalHeader(bytes, file_.size());
+  const auto* header = std::get_if<JournalHeader>(&parsed);
+  return header != nullptr ? std::optional(*header) : std::nullopt;
+}
+
 bool JournalFile::beingWritten() {
   if (writtenSince_ || header_.wasBeingWritten()) return true;
-  std::array<uint8_t, kMinHeaderSize> bytes;
-  if (file_.read(0, bytes) != bytes.size()) return false;
-  writtenSince_ = bytes[kStateAt] == kOnline ||
-                  load<uint64_t>(bytes.data() + kTailRealtimeAt) != header_.tailRealtime;
+  const auto now = headerNow();
+  writtenSince_ = now && (now->wasBeingWritten() || now->tailRealtime != header_.tailRealtime);
   return writtenSince_;
 }
 

@@ -95,6 +95,8 @@ class JournalFile {
   // The daemon closes a user's journal when it is quiet, and opens the same file again for the next
   // entry.
   bool beingWritten();
+  // The header as it is now; nothing if it cannot be read.
+  std::optional<JournalHeader> headerNow();
 
   // The end of the objects: that of the file, because a wrong size in the header could hide some.
   // It becomes smaller if a read finds the file shorter.

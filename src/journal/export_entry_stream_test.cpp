@@ -22,7 +22,11 @@ using Lines = std::vector<std::string>;
 // text is shortened and ends with a slash and the size of the whole value.
 class RecordingTokenizer final : public FieldTokenizer {
  public:
-  bool wants(std::string_view name) const override { return name.starts_with('T'); }
+  bool wants(std::string_view name) const override {
+    ++asked;
+    if (name == "STOP") *stop = true;
+    return name.starts_with('T');
+  }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override {
     texts.push_back(std::string(field) + "=" + std::string(value));
     if (size != value.size()) texts.back() = texts.back().substr(0, 6) + "/" + std::to_string(size);
@@ -30,6 +34,8 @@ class RecordingTokenizer final : public FieldTokenizer {
   }
   uint32_t generation() const override { return 0; }
   Lines texts;
+  mutable size_t asked = 0;
+  StopFlag* stop = nullptr;  // set where a field is named STOP
 };
 
 std::string binary(std::string_view name, std::string_view value,
@@ -80,9 +86,9 @@ class ExportEntryStreamTest : public ::testing::TestWithParam<size_t> {
 
   StopFlag stop = false;
   FileReport report;
+  RecordingTokenizer tokenizer_;
 
  private:
-  RecordingTokenizer tokenizer_;
   WindowBudget windows_;
   ExportReadResources resources_{windows_};
   int file_;
@@ -212,6 +218,14 @@ TEST_P(ExportEntryStreamTest, aStopEndsIt) {
   stop = true;
   EXPECT_FALSE(next());
   EXPECT_THAT(problems(), IsEmpty());
+  // An entry may be as long as the file.
+  stop = false;
+  tokenizer_.stop = &stop;
+  std::string endless = "__REALTIME_TIMESTAMP=1\nSTOP=now\n";
+  for (int i = 0; i < 1000; ++i) endless += "MESSAGE=x\n";
+  append(endless + "\n");
+  while (next()) continue;
+  EXPECT_LT(tokenizer_.asked, 10u);
 }
 
 // Many streams of one store read the same file: an entry of a megabyte, then a usual one.

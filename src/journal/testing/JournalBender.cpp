@@ -76,6 +76,20 @@ uint64_t JournalBender::similar(uint64_t old, std::mt19937_64& random) const {
   return old + 16;
 }
 
+std::vector<JournalLayout> everyLayout() {
+  std::vector<JournalLayout> all;
+  for (const bool compact : {false, true})
+    for (const bool keyed : {false, true})
+      for (const uint8_t compression : {uint8_t{0}, uint8_t{kXz}, uint8_t{kLz4}, uint8_t{kZstd}})
+        for (const uint8_t state : {kArchived, kOnline})
+          all.push_back({.compact = compact,
+                         .keyed = keyed,
+                         .compression = compression,
+                         .compressFrom = 24,
+                         .state = state});
+  return all;
+}
+
 uint64_t damageRounds(uint64_t usual) {
   const char* wanted = std::getenv("TESSEL_DAMAGE_ROUNDS");
   return wanted != nullptr ? std::strtoull(wanted, nullptr, 10) : usual;

@@ -12,6 +12,8 @@
 #include <utility>
 #include <vector>
 
+#include "journal/testing/JournalWriter.h"
+
 namespace tessel::testing {
 
 class JournalBender {
@@ -35,6 +37,9 @@ class JournalBender {
   std::vector<Object> objects_;
   const bool compact_;
 };
+
+// Closed and open files of both layouts, with either hash and each compression.
+std::vector<JournalLayout> everyLayout();
 
 // How many bends a test tries of each kind of file: TESSEL_DAMAGE_ROUNDS, else `usual`.
 uint64_t damageRounds(uint64_t usual);

@@ -6,9 +6,7 @@
 
 #include <map>
 #include <random>
-#include <tuple>
 
-#include "journal/JournalFormat.h"
 #include "journal/testing/JournalBender.h"
 #include "journal/testing/JournalWriter.h"
 #include "os/testing/TemporaryDirectory.h"
@@ -18,7 +16,6 @@
 namespace tessel::ctl {
 namespace {
 
-using namespace journal_format;
 using tessel::testing::JournalLayout;
 using tessel::testing::JournalWriter;
 
@@ -83,28 +80,19 @@ Judged judge(const std::string& path) {
   return judged;
 }
 
-using Parameters = std::tuple<bool, bool, uint8_t, uint8_t>;
-class BentJournalTest : public ::testing::TestWithParam<Parameters> {};
+class BentJournalTest : public ::testing::TestWithParam<JournalLayout> {};
 
 INSTANTIATE_TEST_SUITE_P(Layouts, BentJournalTest,
-                         ::testing::Combine(::testing::Bool(), ::testing::Bool(),
-                                            ::testing::Values(0, kXz, kLz4, kZstd),
-                                            ::testing::Values(kArchived, kOnline)));
+                         ::testing::ValuesIn(tessel::testing::everyLayout()));
 
 TEST_P(BentJournalTest, ChangesNoVerdictWithoutAWord) {
-  const auto [compact, keyed, compression, state] = GetParam();
-  const std::string good = journalWith({.compact = compact,
-                                        .keyed = keyed,
-                                        .compression = compression,
-                                        .compressFrom = 24,
-                                        .state = state})
-                               .bytes();
+  const std::string good = journalWith(GetParam()).bytes();
   const tessel::testing::TemporaryDirectory directory;
   const std::string path = directory.write("a.journal", good);
   const Judged truth = judge(path);
   ASSERT_FALSE(truth.told);
   ASSERT_GE(truth.verdicts.size(), 20u);
-  const tessel::testing::JournalBender bender(good, compact);
+  const tessel::testing::JournalBender bender(good, GetParam().compact);
   std::mt19937_64 random(1);
   const uint64_t rounds = tessel::testing::damageRounds(50);
   for (uint64_t round = 0; round < rounds; ++round) {
