@@ -29,6 +29,11 @@
 
 namespace tessel::journal_format {
 
+// Numbers are taken from a file as they lie there, and an offset is held as a size. Another machine
+// would have to swap bytes in load(), and could not address a file of 4 GiB.
+static_assert(std::endian::native == std::endian::little && sizeof(size_t) == sizeof(uint64_t),
+              "the reader is for 64-bit machines of little-endian byte order");
+
 inline constexpr char kSignature[9] = "LPKSHHRH";
 
 // The shortest header that was ever written. It holds all that we use; newer writers append more.
@@ -110,7 +115,6 @@ inline constexpr uint64_t kMaxSequenceNumber = uint64_t{1} << 48;
 
 template <typename T>
 T load(const uint8_t* at) {
-  static_assert(std::endian::native == std::endian::little, "journals are little-endian");
   T value;
   std::memcpy(&value, at, sizeof value);
   return value;

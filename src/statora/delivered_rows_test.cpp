@@ -111,7 +111,7 @@ TEST_F(DeliveredRowsTest, ARowIsMovedWhole) {
 
 TEST_F(DeliveredRowsTest, TheyTakeTheirPartAndTheOldestGo) {
   run(1);
-  for (const size_t bytes : {20, 400, 2500, 20'000}) {
+  for (const size_t bytes : {20u, 400u, 2500u, 20'000u}) {
     SCOPED_TRACE(bytes);
     fill(6 * kMebibyte / spaceOfRow(bytes + 12), bytes);
     deliver();

@@ -76,7 +76,8 @@ void writeChange(JsonWriter& json, const Change& change, uint64_t count) {
 }
 
 void writePeriods(JsonWriter& json, const Comparison& comparison) {
-  const auto& [a, b] = comparison.periods;
+  const auto& a = comparison.periods[0];
+  const auto& b = comparison.periods[1];
   if (!a || !b) return;
   addDurationChanges(json, a->durations, b->durations);
   json.object("periods", [&] {

@@ -37,7 +37,7 @@ TEST(QuantileSketchTest, QuantilesAreThoseOfSortedValues) {
       // Any float at all: the bits of one, without its sign.
       [&] { return std::bit_cast<float>(static_cast<uint32_t>(random() % 0x7f800000)); }};
   for (const auto& draw : kinds) {
-    for (const size_t count : {1, 2, 3, 7, 100, 20'000}) {
+    for (const size_t count : {1u, 2u, 3u, 7u, 100u, 20'000u}) {
       QuantileSketch sketch;
       std::vector<float> values(count);
       for (float& value : values) sketch.add(value = static_cast<float>(draw()));
@@ -47,7 +47,7 @@ TEST(QuantileSketchTest, QuantilesAreThoseOfSortedValues) {
       EXPECT_EQ(sketch.maximum(), values.back());
       for (size_t rank = 1; rank <= count; rank += 1 + count / 100)
         expectWithinError(sketch.atRank(rank), values[rank - 1]);
-      for (const size_t percent : {1, 5, 50, 95, 99, 100}) {
+      for (const size_t percent : {1u, 5u, 50u, 95u, 99u, 100u}) {
         const size_t rank =
             std::max<size_t>((percent * count + 99) / 100, 1);  // ceil() in integers
         EXPECT_EQ(sketch.quantile(static_cast<double>(percent) / 100), sketch.atRank(rank));
