@@ -49,8 +49,9 @@ class DataMarks {
   // What is known of the data object at `offset`.
   State at(uint64_t offset) const {
     if (Plain(*this).has(offset)) return plain;
-    return isSet(mark_.data(), mark_.size(), offset) ? mark : unknown;
+    return isMark(offset) ? mark : unknown;
   }
+  bool isMark(uint64_t offset) const { return isSet(mark_.data(), mark_.size(), offset); }
   // The objects that are no mark, as they are known now, for a loop. Void after see().
   class Plain {
    public:

@@ -162,10 +162,12 @@ size_t JournalEntryStream::collectTokens() {
 // They are templates, so that they need not ask for the layout in each round.
 template <typename Item>
 bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
-  DataMarks::Plain plain(marks_);
   const auto at = [](const uint8_t* item, size_t ahead) -> uint64_t {
     return load<Item>(item + ahead * kStep<Item>);
   };
+  // The marks of a program's entries often stand in the same place.
+  if (markIndex_ < count && marks_.isMark(at(items, markIndex_))) return true;
+  DataMarks::Plain plain(marks_);
   const uint8_t* item = items;
   const uint8_t* const end = items + count * kStep<Item>;
   for (const uint8_t* last = end - count % 4 * kStep<Item>; item != last; item += 4 * kStep<Item>)
@@ -175,7 +177,10 @@ bool JournalEntryStream::hasMark(const uint8_t* items, size_t count) {
     const uint64_t offset = at(item, 0);
     if (plain.has(offset)) [[likely]]
       continue;
-    if (isMark(offset)) return true;
+    if (isMark(offset)) {
+      markIndex_ = static_cast<size_t>(item - items) / kStep<Item>;
+      return true;
+    }
     plain = DataMarks::Plain(marks_);
   }
   return false;
@@ -204,35 +209,33 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
   const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
   FieldToken* const tokens = context_.resources.tokens.data();
-  FieldToken* kept = tokens;
+  size_t kept = 0;
   uint32_t hash = 0;
   // The objects from here to the entry were written for it, and it has not named them yet. So
   // nothing is remembered of them.
   uint64_t fresh = walk_.firstFresh();
   for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
        item += kStep<Item>) {
-    const uint64_t offset = load<Item>(item);
-    const bool isNew = offset >= fresh && offset < walk_.offset();
-    const TokenCache::Value* known =
-        !isNew && TokenCache::takes(offset) ? cache.findAtOnce(offset) : nullptr;
+    const auto offset = load<Item>(item);
     TokenCache::Value value;
-    if (known != nullptr) [[likely]] {
+    if (const TokenCache::Value* known = cache.findAtOnce(offset); known != nullptr) [[likely]] {
       value = *known;
     } else {
       // We look at the flag here and not for each field: only a miss reads and decompresses, which
       // can take long.
-      if (stopped()) return static_cast<size_t>(kept - tokens);
+      if (stopped()) return kept;
+      const bool isNew = offset >= fresh && offset < walk_.offset();
       value = isNew ? newTokenAt(offset) : rememberedOrNew(offset);
       if (isNew) fresh = offset + 1;
     }
-    *kept = value.token;
+    tokens[kept] = value.token;
     kept += value.token != kNoToken;
     hash ^= value.hash;
   }
   // Half of the hash is enough: one damaged entry in four billion passes.
   if (hash != static_cast<uint32_t>(walk_.header().contentHash) && comparable_) [[unlikely]]
     return intactTokensOf<Item>(items, count);
-  return static_cast<size_t>(kept - tokens);
+  return kept;
 }
 
 TokenCache::Value JournalEntryStream::rememberedOrNew(uint64_t offset) {

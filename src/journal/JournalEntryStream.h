@@ -110,6 +110,7 @@ class JournalEntryStream final : public EntryStream {
   uint64_t work_ = 0;       // that they took, estimated
   DataMarks marks_;
   EntryWalk walk_;
+  size_t markIndex_ = 0;  // which field of the last entry with a mark was found to be one
   // Boot and difference of the two clocks, as the entries before had them.
   Id128 usualBoot_{};
   uint64_t usualDifference_ = 0;

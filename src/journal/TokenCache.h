@@ -16,13 +16,14 @@
 // selects a line, and so neighbours in the file have neighbouring lines. A hash would spread them,
 // but ids are stored in the order of the file and asked for in nearly the same order. The line of
 // an id has several ids that come soon after it, so they share one look into main memory.
-// Each line has five slots. What was stored or found last stands first; a new value pushes out the
-// last.
+// What was stored or found last stands first in its line; a new value pushes out the last.
 //
 // A slot must never return the token of another object: that would put a wrong value into an event.
-// So a slot also holds the tag, the part of the key that does not select the line. Line and tag
-// together are the whole key: the number of the file and the offset divided by eight, because
-// objects begin at multiples of eight.
+// So a slot also holds the key, or the part of it that does not select the line. The key is the
+// number of the file and the offset. A recurring value is looked up for nearly every field, so its
+// slot has the whole key: one addition makes it, and its own bits select the line. A slot of the
+// other table has a tag of 32 bits, so that a line has five slots and not four. Four would be too
+// few: one id in fifty would be read again.
 //
 // Threads: one at a time.
 
@@ -44,84 +45,87 @@ class TokenCache {
   };
 
  private:
-  static constexpr int kPlaceShift = 3;
-  static constexpr int kPlaceBits = 30;  // of an offset, after the shift
   static constexpr int kFileBits = 13;
-  // The place of an object is its offset after the shift.
-  static uint32_t placeOf(uint64_t offset) { return static_cast<uint32_t>(offset >> kPlaceShift); }
+  static constexpr int kOffsetBits = 33;
 
-  static constexpr size_t kSlots = 5;
-  struct Slot {
-    uint32_t tag = 0;  // 0: empty
-    Value value;
-  };
-  struct alignas(64) Line {
-    Slot slots[kSlots];
-  };
+  // Moves what is at `found` to the front of its line.
+  template <typename Slot>
+  static const Value* bringForward(Slot* line, Slot* found) {
+    std::rotate(line, found, found + 1);
+    return &line->value;
+  }
+  template <typename Slot, size_t kSlots>
+  static void pushInto(Slot (&line)[kSlots], const Slot& slot) {
+    std::copy_backward(line, line + kSlots - 1, line + kSlots);
+    line[0] = slot;
+  }
 
-  // 2^kLineBits lines. A line serves 2^kStretchBits neighbouring places.
-  template <int kLineBits, int kStretchBits>
-  struct Table {
-    static constexpr uint32_t kLines = uint32_t{1} << kLineBits;
-
-    std::unique_ptr<Line[]> lines = std::make_unique<Line[]>(kLines);
-
-    void clear() { std::fill_n(lines.get(), kLines, Line{}); }
-  };
-
-  template <int kLineBits, int kStretchBits>
-  class View {
+  // 256 KiB, for 16,384 values. A stretch has 64 bytes, as a line has, so only one object begins in
+  // it: the values of one program stand beside one another and recur together, and one line could
+  // not hold them.
+  class Recurring {
    public:
-    View(const Table<kLineBits, kStretchBits>& table, uint32_t file)
-        : lines_(table.lines.get()),
-          // A tag has no room for the whole place. The bits of it that select the line are free,
-          // and so are the two highest. They hold the number of the file, and a bit that no empty
-          // slot has.
-          file_((file & (kLines - 1)) << kStretchBits | (file >> kLineBits | kTaken) << kPlaceBits),
-          // Without it the beginnings of all files would share the same lines. The factor is 2^32
-          // divided by the golden ratio.
-          firstLine_(file * 0x9e3779b9u) {}
+    struct Slot {
+      uint64_t key = 0;  // 0: empty
+      Value value;
+    };
+    struct alignas(64) Line {
+      Slot slots[4];
+    };
 
-    Slot* slotsOf(uint64_t offset) const {
-      return lines_[((placeOf(offset) >> kStretchBits) + firstLine_) & (kLines - 1)].slots;
+    // Added to an offset, it makes the key. Without the lower half the beginnings of all files
+    // would share the same lines. It is below 2^32, so offsets and it stay below the number of the
+    // file. The factor is 2^32 divided by the golden ratio.
+    static uint64_t baseOf(uint32_t file) {
+      return uint64_t{file + 1} << (kOffsetBits + 1) | (file * 0x9e3779b9u & ~uint32_t{63});
     }
-    uint32_t tagOf(uint64_t offset) const {
-      return (placeOf(offset) & ~((kLines - 1) << kStretchBits)) | file_;
+    Line* lines() const { return lines_.get(); }
+    static Slot (&lineOf(Line* lines, uint64_t key))[4] {
+      return lines[key / sizeof(Line) % kLines].slots;
     }
-    // Null if nothing is remembered. What is found then stands first.
-    const Value* find(uint64_t offset) const {
-      Slot* const slots = slotsOf(offset);
-      for (Slot* slot = slots; slot != slots + kSlots; ++slot) {
-        if (slot->tag != tagOf(offset)) continue;
-        std::rotate(slots, slot, slot + 1);
-        return &slots->value;
-      }
-      return nullptr;
-    }
-    void store(uint64_t offset, Value value) const {
-      Slot* const slots = slotsOf(offset);
-      std::copy_backward(slots, slots + kSlots - 1, slots + kSlots);
-      *slots = {tagOf(offset), value};
-    }
+    void clear() { std::fill_n(lines_.get(), kLines, Line{}); }
 
    private:
-    static constexpr uint32_t kLines = Table<kLineBits, kStretchBits>::kLines;
-    static constexpr uint32_t kTaken = 2;
-    static_assert(kFileBits <= kLineBits + 1 && kLineBits + kStretchBits <= kPlaceBits);
-
-    Line* lines_;
-    uint32_t file_;
-    uint32_t firstLine_;
+    static constexpr size_t kLines = size_t{1} << 12;
+    static_assert(sizeof(Line) == 64);
+    std::unique_ptr<Line[]> lines_ = std::make_unique<Line[]>(kLines);
   };
 
-  // 256 KiB, for 20,480 values. A stretch has 64 bytes, so only one object begins in it: the values
-  // of one program stand beside one another and recur together, and one line could not hold them.
-  static constexpr int kRecurringLineBits = 12;
-  static constexpr int kRecurringStretchBits = 3;
   // 1 MiB, for 81,920 values: more than may be open at once. The shortest entry with a value of its
   // own takes some 200 bytes, so a stretch of 1 KiB has no more than five such values.
-  static constexpr int kAwaitedLineBits = 14;
-  static constexpr int kAwaitedStretchBits = 7;
+  class Awaited {
+   public:
+    struct Slot {
+      uint32_t tag = 0;  // 0: empty
+      Value value;
+    };
+    struct alignas(64) Line {
+      Slot slots[5];
+    };
+
+    Slot (&lineOf(uint32_t file, uint64_t offset) const)[5] {
+      return lines_[((placeOf(offset) >> kStretchBits) + file * 0x9e3779b9u) % kLines].slots;
+    }
+    // A tag has no room for the whole place. The bits of it that select the line are free, and so
+    // are the two highest. They hold the number of the file, and a bit that no empty slot has.
+    static uint32_t tagOf(uint32_t file, uint64_t offset) {
+      constexpr uint32_t kTaken = 2;
+      return (placeOf(offset) & ~((kLines - 1) << kStretchBits)) |
+             (file & (kLines - 1)) << kStretchBits | (file >> kLineBits | kTaken) << kPlaceBits;
+    }
+    void clear() { std::fill_n(lines_.get(), kLines, Line{}); }
+
+   private:
+    static constexpr int kLineBits = 14;
+    static constexpr uint32_t kLines = uint32_t{1} << kLineBits;
+    static constexpr int kStretchBits = 7;  // 128 places
+    // The place of an object is its offset divided by eight: objects begin at multiples of eight.
+    static constexpr int kPlaceBits = kOffsetBits - 3;
+    static uint32_t placeOf(uint64_t offset) { return static_cast<uint32_t>(offset >> 3); }
+    static_assert(kFileBits <= kLineBits + 1 && kLineBits + kStretchBits <= kPlaceBits);
+
+    std::unique_ptr<Line[]> lines_ = std::make_unique<Line[]>(kLines);
+  };
 
  public:
   // Numbers of files are below this.
@@ -129,9 +133,7 @@ class TokenCache {
   // Whether an object at `offset` can be remembered. Other offsets would have the key of another
   // object: those behind 8 GiB, before which the daemon rotates its files, and damaged ones.
   static constexpr bool takes(uint64_t offset) {
-    constexpr uint64_t kMaxOffset = (uint64_t{1} << (kPlaceBits + kPlaceShift)) - 1;
-    constexpr uint64_t kMisplaced = (uint64_t{1} << kPlaceShift) - 1;
-    return (offset & (~kMaxOffset | kMisplaced)) == 0;
+    return offset < uint64_t{1} << kOffsetBits && offset % 8 == 0;
   }
 
   // Forgets all tokens if they are of another generation than `generation`.
@@ -143,39 +145,58 @@ class TokenCache {
     awaited_.clear();
   }
 
-  // The view of one file. Valid while the cache lives; cheap enough to make for every entry. All
-  // calls REQUIRE that the cache takes the offset. What they return is valid until the next call.
+  // The view of one file. Valid while the cache lives; cheap enough to make for every entry. Except
+  // for findAtOnce(), all calls REQUIRE that the cache takes the offset. What they return is valid
+  // until the next call.
   class OfFile {
    public:
     // REQUIRES: file < kMaxFiles.
     OfFile(const TokenCache& cache, uint32_t file)
-        : recurring_(cache.recurring_, file), awaited_(cache.awaited_, file) {}
+        : cache_(cache),
+          lines_(cache.recurring_.lines()),
+          base_(Recurring::baseOf(file)),
+          file_(file) {}
 
     // What is remembered of the data object at `offset`, if a single look finds it; or null. For
-    // nearly every field of an entry that is enough.
-    const Value* findAtOnce(uint64_t offset) const {
-      const Slot& slot = *recurring_.slotsOf(offset);
-      return slot.tag == recurring_.tagOf(offset) ? &slot.value : nullptr;
+    // nearly every field of an entry that is enough. `Offset` has as many bits as the offsets of
+    // the file: one of 32 bits need not be compared with the bound.
+    template <typename Offset>
+    const Value* findAtOnce(Offset offset) const {
+      const uint64_t key = base_ + offset;
+      const Recurring::Slot& slot = Recurring::lineOf(lines_, key)[0];
+      return slot.key == key && uint64_t{offset} >> kOffsetBits == 0 ? &slot.value : nullptr;
     }
     // What is remembered, or null.
     const Value* find(uint64_t offset) const {
-      const Value* known = recurring_.find(offset);
-      return known != nullptr ? known : awaited_.find(offset);
+      auto& recurring = Recurring::lineOf(lines_, base_ + offset);
+      for (Recurring::Slot& slot : recurring)
+        if (slot.key == base_ + offset) return bringForward(recurring, &slot);
+      auto& awaited = cache_.awaited_.lineOf(file_, offset);
+      const uint32_t tag = Awaited::tagOf(file_, offset);
+      for (Awaited::Slot& slot : awaited)
+        if (slot.tag == tag) return bringForward(awaited, &slot);
+      return nullptr;
     }
     // Both REQUIRE that nothing is remembered.
-    void storeRecurring(uint64_t offset, Value value) const { recurring_.store(offset, value); }
+    void storeRecurring(uint64_t offset, Value value) const {
+      pushInto(Recurring::lineOf(lines_, base_ + offset), {base_ + offset, value});
+    }
     // For a value that only one later entry has.
-    void storeAwaited(uint64_t offset, Value value) const { awaited_.store(offset, value); }
+    void storeAwaited(uint64_t offset, Value value) const {
+      pushInto(cache_.awaited_.lineOf(file_, offset), {Awaited::tagOf(file_, offset), value});
+    }
 
    private:
-    View<kRecurringLineBits, kRecurringStretchBits> recurring_;
-    View<kAwaitedLineBits, kAwaitedStretchBits> awaited_;
+    const TokenCache& cache_;
+    Recurring::Line* lines_;
+    uint64_t base_;
+    uint32_t file_;
   };
 
  private:
   uint32_t generation_ = 0;
-  Table<kRecurringLineBits, kRecurringStretchBits> recurring_;
-  Table<kAwaitedLineBits, kAwaitedStretchBits> awaited_;
+  Recurring recurring_;
+  Awaited awaited_;
 };
 
 }  // namespace tessel
