@@ -36,10 +36,36 @@ void EntryMerger::start() {
   runnerUp_ = findRunnerUp();
 }
 
-void EntryMerger::moveFirst(bool more) {
+bool EntryMerger::next() {
+  if (started_ && !heap_.empty()) [[likely]] {
+    // The copies go first: they are compared with the front, so it must not have moved on yet.
+    dropDuplicates();
+    return leaderMoved(heap_.front().stream->next());
+  }
+  start();
+  ++current_;
+  return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+}
+
+// We remember which stream comes second: one comparison with it shows that nothing has to move.
+bool EntryMerger::leaderMoved(bool more) {
+  ++current_;
+  if (more) heap_.front().header = &heap_.front().stream->header();
   if (!more) close(0);
-  siftDown(0);
-  runnerUp_ = findRunnerUp();
+  if (!more || (runnerUp_ != 0 && comesBefore(*heap_[runnerUp_].header, *heap_.front().header))) {
+    siftDown(0);
+    runnerUp_ = findRunnerUp();
+  }
+  return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
+}
+
+// Skips the copies of the current entry in the other streams. A copy compares equal to the front,
+// so in a heap nothing but another copy can stand between them. Therefore we look only at the two
+// places below the front.
+void EntryMerger::dropDuplicates() {
+  for (size_t child = 1; child <= 2 && child < heap_.size(); ++child)
+    while (child < heap_.size() && sameEntry(*heap_[child].header, *heap_.front().header))
+      [[unlikely]] if (!skipCopy(child)) break;
 }
 
 void EntryMerger::close(size_t index) {
@@ -80,9 +106,30 @@ void StoreMerger::add(std::unique_ptr<EntryStream> stream, uint32_t number, cons
   waiting_[sequence].emplace_back(std::move(stream), number);
 }
 
-bool StoreMerger::next() {
+bool StoreMerger::nextOfAll() {
   if (!waiting_.empty()) start();
-  return all_.next();
+  return findLeader(all_.next());
+}
+
+// The leader was moved to its next entry, or to its end, and may lead no longer.
+bool StoreMerger::settle(bool more) {
+  if (sequence_ != nullptr) more = sequence_->leaderMoved(more);
+  return findLeader(all_.leaderMoved(more));
+}
+
+bool StoreMerger::findLeader(bool more) {
+  leads_ = false;
+  if (!more) return false;
+  const uint32_t number = all_.leaderNumber();
+  sequence_ = number < kFirstSequence ? nullptr : sequences_[number - kFirstSequence];
+  const EntryMerger& merger = sequence_ != nullptr ? *sequence_ : all_;
+  leader_ = &merger.leader();
+  leaderNumber_ = merger.leaderNumber();
+  header_ = &leader_->header();
+  rivalInSequence_ = sequence_ != nullptr ? sequence_->rival() : nullptr;
+  rival_ = all_.rival();
+  leads_ = comesFirst();
+  return true;
 }
 
 // A sequence gets its own merger only if it has several files. A file that may hold several
@@ -103,11 +150,6 @@ void StoreMerger::addSequence(Streams& streams) {
   for (auto& [stream, file] : streams) sequence->add(std::move(stream), file);
   sequences_.push_back(sequence.get());
   all_.add(std::move(sequence), number);
-}
-
-uint32_t StoreMerger::streamNumber() const {
-  const uint32_t number = all_.streamNumber();
-  return number < kFirstSequence ? number : sequences_[number - kFirstSequence]->streamNumber();
 }
 
 }  // namespace tessel

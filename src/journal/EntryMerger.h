@@ -62,21 +62,17 @@ class EntryMerger final : public EntryStream {
   // next() was not called.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number);
 
-  bool next() override {
-    if (started_ && !heap_.empty()) [[likely]] {
-      // The copies go first: they are compared with the front, so it must not have moved on yet.
-      dropDuplicates();
-      advanceFirst();
-    } else {
-      start();
-    }
-    ++current_;
-    return !heap_.empty() && !stop_.load(std::memory_order_relaxed);
-  }
+  bool next() override;
   const EntryHeader& header() const override { return *heap_.front().header; }
   Entry entry() override { return heap_.front().stream->entry(); }
-  // Number of the stream that the current entry is from. REQUIRES: next() answered true.
-  uint32_t streamNumber() const { return heap_.front().number; }
+  // The stream of the current entry, and its number. REQUIRES: next() answered true.
+  EntryStream& leader() const { return *heap_.front().stream; }
+  uint32_t leaderNumber() const { return heap_.front().number; }
+  // The entry that comes next of the other streams; null if there are none.
+  const EntryHeader* rival() const { return runnerUp_ == 0 ? nullptr : heap_[runnerUp_].header; }
+  // Takes the place of next() if the caller moved the leader by himself. `more`: what its next()
+  // answered. REQUIRES: no other stream had a copy of the current entry.
+  bool leaderMoved(bool more);
 
  private:
   struct Source {
@@ -94,27 +90,10 @@ class EntryMerger final : public EntryStream {
   };
 
   void start();
-  // Files follow one another in time, so the next entry is nearly always from the same stream. We
-  // remember which stream comes second: one comparison with it shows that nothing has to move.
-  void advanceFirst() {
-    const bool more = heap_.front().next();
-    if (more && (runnerUp_ == 0 || !comesBefore(*heap_[runnerUp_].header, *heap_.front().header)))
-        [[likely]]
-      return;
-    moveFirst(more);
-  }
-  void moveFirst(bool more);
   void close(size_t index);
   size_t findRunnerUp() const;
   void siftDown(size_t index);
-  // Skips the copies of the current entry in the other streams. A copy compares equal to the front,
-  // so in a heap nothing but another copy can stand between them. Therefore we look only at the two
-  // places below the front.
-  void dropDuplicates() {
-    for (size_t child = 1; child <= 2 && child < heap_.size(); ++child)
-      while (child < heap_.size() && sameEntry(*heap_[child].header, *heap_.front().header))
-        [[unlikely]] if (!skipCopy(child)) break;
-  }
+  void dropDuplicates();
   bool skipCopy(size_t child);
 
   const StopFlag& stop_;
@@ -132,14 +111,25 @@ class StoreMerger final : public EntryStream {
   explicit StoreMerger(const StopFlag& stop) : stop_(stop), all_(stop, duplicates_) {}
 
   // Adds a stream whose entries all belong to `sequence`. If `sequence` is all zero, they may
-  // belong to any sequences or to none. REQUIRES: next() was not called.
+  // belong to any sequences or to none. REQUIRES: next() was not called; header() of the stream
+  // answers the same reference for each entry.
   void add(std::unique_ptr<EntryStream> stream, uint32_t number, const Id128& sequence);
 
-  bool next() override;
-  const EntryHeader& header() const override { return all_.header(); }
-  Entry entry() override { return all_.entry(); }
+  bool next() override {
+    // Files follow one another in time, so one of them mostly leads for long. As long as its
+    // entries come before those of all others, no heap has to move, and none of them has a copy.
+    if (leads_) [[likely]] {
+      const bool more = leader_->next();
+      if (more && comesFirst()) [[likely]]
+        return true;
+      return settle(more);
+    }
+    return nextOfAll();
+  }
+  const EntryHeader& header() const override { return *header_; }
+  Entry entry() override { return leader_->entry(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
-  uint32_t streamNumber() const;
+  uint32_t streamNumber() const { return leaderNumber_; }
   // How many copies of entries it left out so far.
   uint64_t duplicates() const { return duplicates_; }
 
@@ -148,13 +138,30 @@ class StoreMerger final : public EntryStream {
 
   void start();
   void addSequence(Streams& streams);
+  // Whether the current entry comes before those of all other streams. Not if it is equal to one.
+  bool comesFirst() const {
+    return (rivalInSequence_ == nullptr || comesBefore(*header_, *rivalInSequence_)) &&
+           (rival_ == nullptr || comesBefore(*header_, *rival_));
+  }
+  bool nextOfAll();
+  bool settle(bool more);
+  bool findLeader(bool more);
 
   const StopFlag& stop_;
   uint64_t duplicates_ = 0;
   std::map<Id128, Streams> waiting_;  // by sequence, until the first entry is asked for
   // In all_, sequence i has the number kFirstSequence + i; all_ owns it.
-  std::vector<const EntryMerger*> sequences_;
+  std::vector<EntryMerger*> sequences_;
   EntryMerger all_;
+  // Of the current entry: its file, the merger of its sequence or null, and the entries that come
+  // next of the other files of the sequence and of all others, or null.
+  EntryStream* leader_ = nullptr;
+  uint32_t leaderNumber_ = 0;
+  const EntryHeader* header_ = nullptr;
+  EntryMerger* sequence_ = nullptr;
+  const EntryHeader* rivalInSequence_ = nullptr;
+  const EntryHeader* rival_ = nullptr;
+  bool leads_ = false;  // the current entry comes before those of all other streams
 };
 
 }  // namespace tessel
