@@ -150,7 +150,7 @@ void EntryWalk::passData() {
 
 bool EntryWalk::next() {
   while (!stopped() && !atEnd()) {
-    passData();
+    if (position_ != listed_) passData();
     const uint64_t offset = position_;
     if (offset == listed_ && takeListed()) [[likely]]
       return true;
@@ -179,7 +179,7 @@ bool EntryWalk::next() {
 // A writer lists an entry only when the entry and all objects before it are finished. So in a file
 // that is being written we go no further than the list. A closed file ends where the header, the
 // list and the walk agree that it ends. If they do not agree, we look at all that is left.
-bool EntryWalk::atEnd() const {
+inline bool EntryWalk::atEnd() const {
   if (listed_ != kEnded) return false;
   const bool behindLast = position_ > file_.header().lastObject;
   if (file_.beingWritten()) return behindLast || !chain_.endedEarly();
@@ -187,7 +187,7 @@ bool EntryWalk::atEnd() const {
 }
 
 // Takes the entry at the place that the walk and the list agree on. False if there is none.
-bool EntryWalk::takeListed() {
+inline bool EntryWalk::takeListed() {
   const uint64_t size = file_.readEntry(listed_, entryEnd_, header_);
   if (size == 0) [[unlikely]]
     return false;
@@ -209,7 +209,7 @@ bool EntryWalk::take(uint64_t offset) {
   return true;
 }
 
-void EntryWalk::accept(uint64_t offset, uint64_t size) {
+inline void EntryWalk::accept(uint64_t offset, uint64_t size) {
   TESSEL_INVARIANT(offset > entry_);  // so no entry comes twice
   // The daemon's numbers rise. Of two that do not, one is wrong, and the merge believed it.
   if (header_.sequenceNumber <= lastNumber_) [[unlikely]]
@@ -253,7 +253,7 @@ bool EntryWalk::listIsRight(uint64_t object) {
   return false;
 }
 
-void EntryWalk::advanceList() {
+inline void EntryWalk::advanceList() {
   // An entry that the list named too late may come up again here.
   do listed_ = chain_.next();
   while (listed_ == entry_ && listed_ != 0);

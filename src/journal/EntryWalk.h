@@ -110,7 +110,7 @@ class EntryWalk {
   void passData();
   ObjectHeader objectAt(uint64_t offset);
   bool takeListed();
-  bool take(uint64_t offset);
+  [[gnu::noinline]] bool take(uint64_t offset);
   void accept(uint64_t offset, uint64_t size);
   void compareWithList(uint64_t offset);
   bool listIsRight(uint64_t object);

@@ -102,7 +102,8 @@ uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& ent
   const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
   if (at == nullptr || load<uint16_t>(at) != kEntry) return 0;  // an entry has no flags
   const auto size = load<uint64_t>(at + kObjectSizeAt);
-  if (size <= kEntryItemsAt || size > room || (size - kEntryItemsAt) % itemSize() != 0) return 0;
+  if (size <= kEntryItemsAt || size > room || ((size - kEntryItemsAt) & (itemSize() - 1)) != 0)
+    return 0;
   entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
   entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
   entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
