@@ -113,7 +113,12 @@ class DataMarks {
     return word;
   }
   [[gnu::noinline]] State seeUnusual(uint64_t offset, std::string_view head) {
-    const auto matches = [head](const Mark& one) { return head.starts_with(one.text); };
+    const uint64_t first = firstWord(head);
+    // The word tells all of a short mark.
+    const auto matches = [&](const Mark& one) {
+      return (first & one.mask) == one.word &&
+             (one.text.size() <= sizeof first || head.starts_with(one.text));
+    };
     const State state = std::ranges::any_of(marks_, matches) ? mark : plain;
     const uint64_t word = offset >> kWordShift;
     if (word >= plain_.size() && !grow(word)) return state == plain ? unknown : mark;

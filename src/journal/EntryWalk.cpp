@@ -253,14 +253,22 @@ bool EntryWalk::listIsRight(uint64_t object) {
   return false;
 }
 
-inline void EntryWalk::advanceList() {
+[[gnu::always_inline]] inline void EntryWalk::advanceList() {
+  listed_ = chain_.next();
+  // position_ lies behind the header and behind the current entry.
+  if (listed_ >= position_ && file_.mayHoldObject(listed_, kEntryItemsAt)) [[likely]]
+    return;
+  checkListed();
+}
+
+// The list has ended, or names a place where the next entry cannot be.
+void EntryWalk::checkListed() {
   // An entry that the list named too late may come up again here.
-  do listed_ = chain_.next();
-  while (listed_ == entry_ && listed_ != 0);
-  if (listed_ == 0) [[unlikely]] {
+  while (listed_ == entry_ && listed_ != 0) listed_ = chain_.next();
+  if (listed_ == 0) {
     listed_ = kEnded;
     if (chain_.endedEarly()) tellOfList(chain_.problemAt());
-  } else if (listed_ < position_ || !file_.mayHoldObject(listed_, kEntryItemsAt)) [[unlikely]] {
+  } else if (listed_ < position_ || !file_.mayHoldObject(listed_, kEntryItemsAt)) {
     // The file may grow while we read. What lies behind its old end was added since.
     if (found_ >= file_.header().entryCount && listed_ >= file_.objectsEnd() &&
         file_.beingWritten()) {

@@ -113,8 +113,9 @@ class EntryWalk {
   [[gnu::noinline]] bool take(uint64_t offset);
   void accept(uint64_t offset, uint64_t size);
   void compareWithList(uint64_t offset);
-  bool listIsRight(uint64_t object);
+  [[gnu::noinline]] bool listIsRight(uint64_t object);
   void advanceList();
+  [[gnu::noinline]] void checkListed();
   void tellOfList(uint64_t offset);
   bool passDamage();
   bool resynchronise(uint64_t offset);

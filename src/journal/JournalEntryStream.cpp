@@ -211,23 +211,12 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   FieldToken* const tokens = context_.resources.tokens.data();
   size_t kept = 0;
   uint32_t hash = 0;
-  // The objects from here to the entry were written for it, and it has not named them yet. So
-  // nothing is remembered of them.
-  uint64_t fresh = walk_.firstFresh();
+  fresh_ = walk_.firstFresh();
   for (const uint8_t *item = items, *end = items + count * kStep<Item>; item != end;
        item += kStep<Item>) {
     const auto offset = load<Item>(item);
-    TokenCache::Value value;
-    if (const TokenCache::Value* known = cache.findAtOnce(offset); known != nullptr) [[likely]] {
-      value = *known;
-    } else {
-      // We look at the flag here and not for each field: only a miss reads and decompresses, which
-      // can take long.
-      if (stopped()) return kept;
-      const bool isNew = offset >= fresh && offset < walk_.offset();
-      value = isNew ? newTokenAt(offset) : rememberedOrNew(offset);
-      if (isNew) fresh = offset + 1;
-    }
+    const TokenCache::Value* known = cache.findAtOnce(offset);
+    const TokenCache::Value value = known != nullptr ? *known : missed(offset);
     tokens[kept] = value.token;
     kept += value.token != kNoToken;
     hash ^= value.hash;
@@ -236,6 +225,16 @@ size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
   if (hash != static_cast<uint32_t>(walk_.header().contentHash) && comparable_) [[unlikely]]
     return intactTokensOf<Item>(items, count);
   return kept;
+}
+
+// The token of a field that a single look does not find. We look at the stop flag here and not for
+// each field: only a miss reads and decompresses, which can take long. After a stop the entry ends
+// without its further tokens.
+TokenCache::Value JournalEntryStream::missed(uint64_t offset) {
+  if (stopped()) return {};
+  if (offset < fresh_ || offset >= walk_.offset()) return rememberedOrNew(offset);
+  fresh_ = offset + 1;
+  return newTokenAt(offset);
 }
 
 TokenCache::Value JournalEntryStream::rememberedOrNew(uint64_t offset) {

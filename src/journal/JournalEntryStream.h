@@ -94,8 +94,9 @@ class JournalEntryStream final : public EntryStream {
   size_t tokensOf(const uint8_t* items, size_t count);
   template <typename Item>
   size_t intactTokensOf(const uint8_t* items, size_t count);
-  [[gnu::noinline]] TokenCache::Value rememberedOrNew(uint64_t offset);
-  [[gnu::noinline]] TokenCache::Value newTokenAt(uint64_t offset);
+  [[gnu::noinline]] TokenCache::Value missed(uint64_t offset);
+  TokenCache::Value rememberedOrNew(uint64_t offset);
+  TokenCache::Value newTokenAt(uint64_t offset);
   void remember(uint64_t offset, const DataObject& data, TokenCache::Value value);
   std::optional<Text> textAt(uint64_t offset, DataObject& data);
   FieldToken tokenOf(const Text& text);
@@ -110,6 +111,9 @@ class JournalEntryStream final : public EntryStream {
   uint64_t work_ = 0;       // that they took, estimated
   DataMarks marks_;
   EntryWalk walk_;
+  // The objects from here to the entry were written for it, and it has not named them yet. So
+  // nothing is remembered of them.
+  uint64_t fresh_ = 0;
   size_t markIndex_ = 0;  // which field of the last entry with a mark was found to be one
   // Boot and difference of the two clocks, as the entries before had them.
   Id128 usualBoot_{};

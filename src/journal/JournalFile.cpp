@@ -17,16 +17,6 @@ namespace tessel {
 
 using namespace journal_format;
 
-namespace {
-
-Id128 loadId(const uint8_t* at) {
-  Id128 id;
-  std::memcpy(id.data(), at, id.size());
-  return id;
-}
-
-}  // namespace
-
 std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint8_t> bytes,
                                                             uint64_t fileSize) {
   if (bytes.empty()) return "it is empty";
@@ -36,8 +26,8 @@ std::variant<JournalHeader, std::string> parseJournalHeader(std::span<const uint
   JournalHeader header;
   header.incompatibleFlags = load<uint32_t>(at + kIncompatibleFlagsAt);
   header.state = at[kStateAt];
-  header.fileId = loadId(at + kFileIdAt);
-  header.sequenceId = loadId(at + kSequenceIdAt);
+  header.fileId = load<Id128>(at + kFileIdAt);
+  header.sequenceId = load<Id128>(at + kSequenceIdAt);
   header.headerSize = load<uint64_t>(at + kHeaderSizeAt);
   // With the shortest header, the reader finds the first object by itself.
   if (!aligned(header.headerSize) || header.headerSize < kMinHeaderSize ||
@@ -93,28 +83,6 @@ bool JournalFile::beingWritten() {
   const auto now = headerNow();
   writtenSince_ = now && (now->wasBeingWritten() || now->tailRealtime != header_.tailRealtime);
   return writtenSince_;
-}
-
-uint64_t JournalFile::readEntry(uint64_t offset, uint64_t from, EntryHeader& entry) {
-  if (!mayHoldObject(offset, kEntryItemsAt)) return 0;
-  // Computed first: at() may find the file cut before `offset`, and objectsEnd() then moves.
-  const uint64_t room = objectsEnd() - offset;
-  const uint8_t* at = file_.at(offset, kEntryItemsAt, from);
-  if (at == nullptr || load<uint16_t>(at) != kEntry) return 0;  // an entry has no flags
-  const auto size = load<uint64_t>(at + kObjectSizeAt);
-  if (size <= kEntryItemsAt || size > room || ((size - kEntryItemsAt) & (itemSize() - 1)) != 0)
-    return 0;
-  entry.sequenceNumber = load<uint64_t>(at + kEntrySequenceAt);
-  entry.realtime = load<uint64_t>(at + kEntryRealtimeAt);
-  entry.monotonic = load<uint64_t>(at + kEntryMonotonicAt);
-  entry.bootId = loadId(at + kEntryBootAt);
-  entry.contentHash = load<uint64_t>(at + kEntryHashAt);
-  // The merge and the range trust these numbers. So an entry is invalid if one of them is greater
-  // than any that a daemon writes.
-  if (entry.sequenceNumber == 0 || entry.sequenceNumber > kMaxSequenceNumber ||
-      entry.realtime == 0 || entry.realtime >= kMaxTime || entry.monotonic >= kMaxTime)
-    return 0;
-  return size;
 }
 
 bool JournalFile::readData(uint64_t offset, size_t most, std::span<uint8_t> scratch,

@@ -25,11 +25,11 @@ class NumberWatch {
   // `counter` is equal for all files whose entries one daemon numbers. Entries come in their order,
   // but those of several files may change places with their neighbours.
   void see(uint32_t counter, const EntryHeader& entry) {
-    if (last_ >= rows_.size() || rows_[last_].counter != counter ||
-        !sameId(rows_[last_].boot, entry.bootId)) [[unlikely]] {
+    if (last_ == nullptr || last_->counter != counter || !sameId(last_->boot, entry.bootId))
+        [[unlikely]] {
       if (!find(counter, entry)) return;
     }
-    Row& row = rows_[last_];
+    Row& row = *last_;
     if (entry.sequenceNumber == row.number + 1) [[likely]] {
       row.number = entry.sequenceNumber;
     } else if (entry.sequenceNumber != 0) {
@@ -68,18 +68,19 @@ class NumberWatch {
     std::vector<Gap> gaps;  // numbers below it that did not come yet, rising
   };
 
-  bool find(uint32_t counter, const EntryHeader& entry) {
+  [[gnu::noinline]] bool find(uint32_t counter, const EntryHeader& entry) {
     if (entry.sequenceNumber == 0) return false;
     const auto known = std::find_if(rows_.begin(), rows_.end(), [&](const Row& row) {
       return row.counter == counter && row.boot == entry.bootId;
     });
     if (known == rows_.end() && rows_.size() == kMaxRows) return false;
-    last_ = static_cast<size_t>(known - rows_.begin());
-    if (known == rows_.end()) rows_.push_back({counter, entry.bootId, entry.sequenceNumber, {}});
+    last_ = known != rows_.end()
+                ? &*known
+                : &rows_.emplace_back(Row{counter, entry.bootId, entry.sequenceNumber, {}});
     return true;
   }
 
-  static void advance(Row& row, uint64_t number) {
+  [[gnu::noinline]] static void advance(Row& row, uint64_t number) {
     if (number > row.number) {
       if (row.gaps.size() < kMaxGaps) row.gaps.push_back({row.number + 1, number - 1});
       row.number = number;
@@ -99,7 +100,7 @@ class NumberWatch {
   }
 
   std::vector<Row> rows_;
-  size_t last_ = 0;
+  Row* last_ = nullptr;  // of the last entry; find() sets it anew when it adds a row
 };
 
 }  // namespace tessel
