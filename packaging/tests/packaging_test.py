@@ -92,7 +92,7 @@ class Units(unittest.TestCase):
         unit = settings(FORWARDER)
         self.assertIn("/etc/statora/forwarder.env", unit["ConditionPathExists"])
         self.assertNotEqual(unit["User"], settings(REPORTER)["User"])
-        with open(os.path.join(PACKAGING, "debian", "statora-forwarder.postinst"), encoding="utf-8") as script:
+        with open(os.path.join(ROOT, "debian", "statora-forwarder.postinst"), encoding="utf-8") as script:
             self.assertNotRegex(script.read(), r"(?m)^\s*(systemctl|deb-systemd-helper) (--\S+ )*enable")
 
 class Accounts(unittest.TestCase):
@@ -162,7 +162,7 @@ class MaintainerScripts(unittest.TestCase):
                 os.mkdir(os.path.join(root, "var/lib/tessel-marker"))
             binds = "".join(f"mount -n --bind {root}/{folder} /{folder} && " for folder in ("etc", "run", "var/lib", "var/tmp"))
             result = run("unshare", "--mount", "sh", "-c", binds + 'exec sh "$@"', "sh",
-                         os.path.join(PACKAGING, "debian", "tessel-reporter." + script), *arguments,
+                         os.path.join(ROOT, "debian", "tessel-reporter." + script), *arguments,
                          env={"PATH": f"{root}/bin:/usr/sbin:/usr/bin:/sbin:/bin", "ACTIVE_STATE": active})
             self.assertEqual(result.returncode, 0, result.stderr)
             self.assertTrue(os.path.exists(os.path.join(root, "var/tmp/victim")))
@@ -210,8 +210,12 @@ class Texts(unittest.TestCase):
         # "%@" alone stands for the texts of linux/Findings.cpp, which have a test beside them.
         self.assertEqual([text for text in warnings if not text.startswith((*table, "%@"))], [])
 
+    def test_one_version_stands_everywhere(self):
+        result = run(os.path.join(ROOT, "scripts", "release"), "--versions")
+        self.assertEqual((result.returncode, result.stderr), (0, ""))
+
     def test_scripts(self):
-        scripts = glob.glob(os.path.join(PACKAGING, "debian", "*.p*"))
+        scripts = [path for kind in ("postinst", "prerm", "postrm") for path in glob.glob(os.path.join(ROOT, "debian", "*." + kind))]
         folders = [os.path.join(ROOT, name) for name in ("", ".ci", "scripts", "tests", "examples", "packaging")]
         for path in sorted(path for folder in folders for path in glob.glob(os.path.join(folder, "*"))):
             if os.path.isfile(path) and os.access(path, os.X_OK):
