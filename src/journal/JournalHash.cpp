@@ -5,6 +5,7 @@
 #include <bit>
 
 #include "journal/JournalFormat.h"
+#include "platform/SipHash.h"
 
 namespace tessel {
 
@@ -55,28 +56,6 @@ uint32_t partOfWord(const uint8_t* at, size_t size) {
          uint32_t{at[size - 1]} << 8 * (size - 1);
 }
 
-struct SipState {
-  uint64_t v0, v1, v2, v3;
-
-  void round() {
-    v0 += v1;
-    v2 += v3;
-    v1 = std::rotl(v1, 13) ^ v0;
-    v3 = std::rotl(v3, 16) ^ v2;
-    v0 = std::rotl(v0, 32) + v3;
-    v2 += v1;
-    v3 = std::rotl(v3, 21) ^ v0;
-    v1 = std::rotl(v1, 17) ^ v2;
-    v2 = std::rotl(v2, 32);
-  }
-  void take(uint64_t word) {
-    v3 ^= word;
-    round();
-    round();
-    v0 ^= word;
-  }
-};
-
 }  // namespace
 
 uint64_t lookup3(std::span<const uint8_t> bytes) {
@@ -100,18 +79,14 @@ uint64_t lookup3(std::span<const uint8_t> bytes) {
 }
 
 uint64_t sipHash24(std::span<const uint8_t> bytes, const Id128& key) {
-  const uint64_t k0 = load<uint64_t>(key.data());
-  const uint64_t k1 = load<uint64_t>(key.data() + 8);
-  SipState state{k0 ^ 0x736f6d6570736575, k1 ^ 0x646f72616e646f6d, k0 ^ 0x6c7967656e657261,
-                 k1 ^ 0x7465646279746573};
+  SipState state(load<uint64_t>(key.data()), load<uint64_t>(key.data() + 8));
   const uint8_t* at = bytes.data();
   size_t left = bytes.size();
   for (; left >= 8; left -= 8, at += 8) state.take(load<uint64_t>(at));
   const uint64_t upper = left > 4 ? partOfWord(at + 4, left - 4) : 0;
   state.take(partOfWord(at, left) | upper << 32 | uint64_t{bytes.size()} << 56);
   state.v2 ^= 0xff;
-  for (int i = 0; i < 4; ++i) state.round();
-  return state.v0 ^ state.v1 ^ state.v2 ^ state.v3;
+  return state.finish();
 }
 
 }  // namespace tessel
