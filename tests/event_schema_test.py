@@ -116,7 +116,8 @@ class Forwarded(MachineTest):
         with open(self.machine.os_release, "w", encoding="utf-8") as file:
             file.write('NAME="Debian"\nVERSION_ID="12"\n')
         payload_keys = {key for _, pairs in self.machine.rows() for key, _ in pairs}
-        out = self.machine.result(self.machine.start("statora_forwarder", "--dry-run", TESSEL_FORWARD_INSTANCE_ID="1")).out
+        out = self.machine.result(self.machine.start("statora_forwarder", "--dry-run=raw", TESSEL_FORWARD_INSTANCE_ID="1",
+                                                     OTEL_EXPORTER_OTLP_PROTOCOL="http/json")).out
         added = set()
         for body in map(json.loads, out.splitlines()):
             [logs] = body["resourceLogs"]
@@ -130,7 +131,7 @@ class Forwarded(MachineTest):
 class WhatCanBeSet(unittest.TestCase):
     LAUNCH = dict(re.findall(r'"(TESSEL_\w+)", configuration\.(\w+)', text_of("src/linux/LaunchConfiguration.cpp")))
     SETTINGS = text_of("src/forwarder/Settings.cpp")
-    FORWARDER = set(re.findall(r'"(TESSEL_FORWARD_\w+)"', SETTINGS)) | {
+    FORWARDER = set(re.findall(r'"(TESSEL_FORWARD_\w+|OTEL_RESOURCE_\w+)"', SETTINGS)) | {
         "OTEL_EXPORTER_OTLP_" + name for name in re.findall(r'(?:standard|path)\("(\w+)"\)', SETTINGS)}
 
     def used_in(self, *paths):

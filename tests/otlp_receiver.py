@@ -8,6 +8,8 @@ import threading
 import time
 from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 
+import otlp_protobuf
+
 
 class Answer:
     """The answer to one request. `kind` is whole, or says where the connection breaks: cut in the body, or in the head."""
@@ -22,17 +24,32 @@ class Request:
         self.gzipped = headers.get("Content-Encoding") == "gzip"
 
     @property
-    def text(self):
-        return (gzip.decompress(self.raw) if self.gzipped else self.raw).decode()
+    def body(self):
+        return gzip.decompress(self.raw) if self.gzipped else self.raw
+
+    @property
+    def message(self):
+        """The body as OTLP's JSON says it, in whichever encoding it came."""
+        return (otlp_protobuf.read if self.headers["Content-Type"] == "application/x-protobuf" else json.loads)(self.body)
 
     @property
     def records(self):
-        return [record for resource in json.loads(self.text)["resourceLogs"] for scope in resource["scopeLogs"]
+        return [record for resource in self.message["resourceLogs"] for scope in resource["scopeLogs"]
                 for record in scope["logRecords"]]
 
 
+def attribute_of(record, name):
+    [value] = [attribute["value"] for attribute in record["attributes"] if attribute["key"] == name]
+    return next(iter(value.values()))
+
+
 def uid_of(record):
-    return next(a["value"]["stringValue"] for a in record["attributes"] if a["key"] == "log.record.uid")
+    return attribute_of(record, "log.record.uid")
+
+
+def number_of(record):
+    """The number that ForwarderTest.add() gave the row, from 0."""
+    return int(attribute_of(record, "Number1Value"))
 
 
 class Receiver:
@@ -103,8 +120,11 @@ class Receiver:
             handler.connection.shutdown(socket.SHUT_RDWR)
             handler.close_connection = True
 
+    def accepted_records(self):
+        return [record for request in list(self.accepted) for record in request.records]
+
     def accepted_uids(self):
-        return [uid_of(record) for request in list(self.accepted) for record in request.records]
+        return [uid_of(record) for record in self.accepted_records()]
 
 
 def make_certificate(directory, name):

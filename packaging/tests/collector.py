@@ -3,8 +3,9 @@
 records it held."""
 import gzip
 import http.server
-import json
 import sys
+
+import otlp_protobuf
 
 
 class Collector(http.server.BaseHTTPRequestHandler):
@@ -12,14 +13,13 @@ class Collector(http.server.BaseHTTPRequestHandler):
         body = self.rfile.read(int(self.headers["Content-Length"]))
         if self.headers.get("Content-Encoding") == "gzip":
             body = gzip.decompress(body)
-        count = sum(len(scope["logRecords"]) for resource in json.loads(body)["resourceLogs"]
+        count = sum(len(scope["logRecords"]) for resource in otlp_protobuf.read(body)["resourceLogs"]
                     for scope in resource["scopeLogs"])
         with open(sys.argv[1], "a", encoding="utf-8") as file:
             print(count, file=file)
         self.send_response(200)
-        self.send_header("Content-Length", "2")
+        self.send_header("Content-Length", "0")
         self.end_headers()
-        self.wfile.write(b"{}")
 
 
 http.server.HTTPServer(("127.0.0.1", 4318), Collector).serve_forever()

@@ -86,18 +86,18 @@ class Variables {
 
 // `text` with %XX decoded. Absent if the result holds a control character: a line feed would let a
 // value add headers of its own.
-std::optional<std::string> headerText(std::string_view text) {
+std::optional<std::string> decoded(std::string_view text) {
   std::string out;
   for (size_t at = 0; at < text.size(); ++at) {
     char byte = text[at];
     if (byte == '%') {
-      unsigned decoded = 0;
+      unsigned code = 0;
       if (at + 2 >= text.size() ||
-          std::from_chars(text.data() + at + 1, text.data() + at + 3, decoded, 16).ptr !=
+          std::from_chars(text.data() + at + 1, text.data() + at + 3, code, 16).ptr !=
               text.data() + at + 3) {
         return {};
       }
-      byte = static_cast<char>(decoded);
+      byte = static_cast<char>(code);
       at += 2;
     }
     if (static_cast<unsigned char>(byte) < 0x20 || byte == 0x7f) return {};
@@ -106,9 +106,13 @@ std::optional<std::string> headerText(std::string_view text) {
   return out;
 }
 
-// Reads name=value,name=value, percent-encoded. Absent if the text has another form.
-std::optional<Headers> parseHeaders(std::string_view text) {
-  Headers headers;
+using Members = std::vector<std::pair<std::string, std::string>>;
+
+constexpr char kMembersForm[] = "name=value,name=value, percent-encoded";
+
+// Reads such a list. Absent if the text has another form.
+std::optional<Members> parseMembers(std::string_view text) {
+  Members members;
   while (!text.empty()) {
     const std::string_view member = trimmed(text.substr(0, text.find(',')));
     text.remove_prefix(std::min(
@@ -116,10 +120,21 @@ std::optional<Headers> parseHeaders(std::string_view text) {
     if (member.empty()) continue;
     const size_t equals = member.find('=');
     if (equals == 0 || equals == std::string_view::npos) return {};
-    const auto name = headerText(trimmed(member.substr(0, equals)));
-    const auto value = headerText(trimmed(member.substr(equals + 1)));
-    if (!name || !value || name->find(':') != std::string::npos) return {};
-    headers.push_back(*name + ": " + *value);
+    auto name = decoded(trimmed(member.substr(0, equals)));
+    auto value = decoded(trimmed(member.substr(equals + 1)));
+    if (!name || !value) return {};
+    members.emplace_back(std::move(*name), std::move(*value));
+  }
+  return members;
+}
+
+std::optional<Headers> parseHeaders(std::string_view text) {
+  const auto members = parseMembers(text);
+  if (!members) return {};
+  Headers headers;
+  for (const auto& [name, value] : *members) {
+    if (name.find(':') != std::string::npos) return {};
+    headers.push_back(name + ": " + value);
   }
   return headers;
 }
@@ -188,9 +203,9 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
     return;
   }
   // OpenTelemetry's rule: the address for all signals gets the path of this signal appended, and
-  // the address for logs is complete as it is.
+  // the address for logs is complete as it is. A format that is not OTLP has no such path.
   settings.url = endpoint->value;
-  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT") {
+  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT" && !settings.output->path.empty()) {
     while (settings.url.ends_with('/')) settings.url.pop_back();
     settings.url += settings.output->path;
   }
@@ -207,9 +222,23 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
 void addHeaders(Variables& variables, ForwarderSettings& settings, const std::string& source,
                 std::string_view text) {
   const auto headers = parseHeaders(text);
-  if (!headers)
-    return variables.complain(source, "(not shown)", "name=value,name=value, percent-encoded");
+  if (!headers) return variables.complain(source, "(not shown)", kMembersForm);
   settings.headers.insert(settings.headers.end(), headers->begin(), headers->end());
+}
+
+void readEncoding(Variables& variables, EncodingSettings& settings) {
+  settings.output = readOutput(variables);
+  settings.sendInstanceId = variables.flag("TESSEL_FORWARD_INSTANCE_ID");
+  const auto text = variables.value("OTEL_RESOURCE_ATTRIBUTES");
+  if (!text) return;
+  auto members = parseMembers(*text);
+  // A text that is not UTF-8 would make receivers refuse every request.
+  const auto isText = [](const auto& member) {
+    return isValidUtf8(member.first) && isValidUtf8(member.second);
+  };
+  if (!members || !std::ranges::all_of(*members, isText))
+    return variables.complain("OTEL_RESOURCE_ATTRIBUTES", *text, kMembersForm);
+  settings.resourceAttributes = std::move(*members);
 }
 
 // The service manager makes $CREDENTIALS_DIRECTORY. Only this service can read its files, and they
@@ -256,7 +285,7 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
   ForwarderSettings settings;
   Variables variables(environment);
   // The format comes first, because the endpoint's path depends on it.
-  settings.output = readOutput(variables);
+  readEncoding(variables, settings);
   readEndpoint(variables, settings);
   readTransport(variables, settings);
   readCredentials(variables, settings);
@@ -269,18 +298,18 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
   if (const auto rate = variables.number("TESSEL_FORWARD_RATE", 0)) {
     settings.recordsPerSecond = static_cast<uint64_t>(*rate);
   }
-  settings.sendInstanceId = variables.flag("TESSEL_FORWARD_INSTANCE_ID");
   settings.sendHealth = variables.flag("TESSEL_FORWARD_HEALTH");
   if (variables.error()) return *variables.error();
   return settings;
 }
 
-std::variant<const OutputFormat*, LaunchError> readOutputFormat(
+std::variant<EncodingSettings, LaunchError> readEncodingSettings(
     const EnvironmentReader& environment) {
+  EncodingSettings settings;
   Variables variables(environment);
-  const OutputFormat* const output = readOutput(variables);
+  readEncoding(variables, settings);
   if (variables.error()) return *variables.error();
-  return output;
+  return settings;
 }
 
 }  // namespace tessel

@@ -3,7 +3,7 @@
 //
 // The collector is set by OpenTelemetry's variables OTEL_EXPORTER_OTLP_<NAME>, where <NAME> is
 // ENDPOINT, HEADERS, TIMEOUT, COMPRESSION, CERTIFICATE, CLIENT_CERTIFICATE, CLIENT_KEY or PROTOCOL
-// (the output format). OTEL_EXPORTER_OTLP_LOGS_<NAME> wins over it. Secrets are files in
+// (http/protobuf or http/json). OTEL_EXPORTER_OTLP_LOGS_<NAME> wins over it. Secrets are files in
 // $CREDENTIALS_DIRECTORY: otlp-headers, otlp-certificate, otlp-client-certificate, otlp-client-key.
 //
 //                                                                                 default
@@ -30,8 +30,14 @@
 
 namespace tessel {
 
-struct ForwarderSettings {
+// What a request looks like, whoever receives it.
+struct EncodingSettings {
   const OutputFormat* output = outputFormats().front();
+  ResourceAttributes resourceAttributes;  // of OTEL_RESOURCE_ATTRIBUTES
+  bool sendInstanceId = false;
+};
+
+struct ForwarderSettings : EncodingSettings {
   std::string url;
   // Where the events go, for people: scheme, host and port of the URL. Users, passwords, paths and
   // queries may hold secrets.
@@ -45,7 +51,6 @@ struct ForwarderSettings {
   std::chrono::seconds spread{300};
   std::chrono::seconds interval{30};
   std::chrono::milliseconds retry{5000};
-  bool sendInstanceId = false;
   bool sendHealth = false;
 };
 
@@ -53,8 +58,8 @@ struct ForwarderSettings {
 // error never quotes headers, because they hold secrets.
 std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
     const EnvironmentReader& environment);
-// The output format alone, which needs no endpoint.
-std::variant<const OutputFormat*, LaunchError> readOutputFormat(
+// These settings alone, which need no endpoint.
+std::variant<EncodingSettings, LaunchError> readEncodingSettings(
     const EnvironmentReader& environment);
 
 }  // namespace tessel

@@ -25,9 +25,12 @@
 namespace tessel {
 namespace {
 
+constexpr char kText[] = "text";
+constexpr char kRaw[] = "raw";
+
 struct Arguments {
   bool once = false;
-  bool dryRun = false;
+  std::string dryRun;  // empty, kText or kRaw
   bool requeue = false;
 };
 
@@ -37,8 +40,8 @@ double chance() {
   return std::uniform_real_distribution<double>(0, 1)(random);
 }
 
-// Prints the bodies that would be sent if no request failed, one a line. It opens the spool only
-// for reading, so that it can run beside the service and the forwarder.
+// Prints the bodies that would be sent if no request failed. It opens the spool only for reading,
+// so that it can run beside the service and the forwarder.
 int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   const ForwarderOptions options;
   ForwarderState state(launch.stateDirectory);
@@ -51,7 +54,7 @@ int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
     if (events.empty()) return state.status().ok() ? 0 : EX_IOERR;
     const Batch batch = cutBatch(std::move(events), encoder, state.spoolId(), options.maxBytes);
     after = batch.lastId;
-    if (!batch.records.empty()) std::cout << encoder.body(batch.records) << '\n';
+    if (!batch.records.empty()) std::cout << encoder.body(batch.records);
   }
 }
 
@@ -214,7 +217,7 @@ int forward(const LaunchConfiguration& launch, const ForwarderSettings& settings
   // Never deleted: the signal thread uses them for as long as the process lives.
   auto& stop = *new Semaphore(0);
   const auto encoder = settings.output->makeEncoder(
-      readResourceFacts(launch.osReleasePath, settings.sendInstanceId));
+      readResources(launch.osReleasePath, settings.resourceAttributes, settings.sendInstanceId));
   auto& collector = *new CurlCollector(settings, encoder->contentType());
   stopOnSignals(stop, collector);
   Service service(launch, settings, *encoder, stop, collector);
@@ -237,12 +240,15 @@ int run(const Arguments& arguments) {
   // Neither --requeue nor --dry-run needs a collector, so the settings of one are not read for
   // them.
   if (arguments.requeue) return requeue(configuration.stateDirectory);
-  if (arguments.dryRun) {
-    const auto output = readOutputFormat(environment);
-    if (const auto* error = std::get_if<LaunchError>(&output)) return complain(*error);
-    const ResourceFacts facts = readResourceFacts(configuration.osReleasePath,
-                                                  environment("TESSEL_FORWARD_INSTANCE_ID") == "1");
-    return dryRun(configuration, *std::get<const OutputFormat*>(output)->makeEncoder(facts));
+  if (!arguments.dryRun.empty()) {
+    const auto encoding = readEncodingSettings(environment);
+    if (const auto* error = std::get_if<LaunchError>(&encoding)) return complain(*error);
+    const auto& settings = std::get<EncodingSettings>(encoding);
+    const Resources resources = readResources(configuration.osReleasePath,
+                                              settings.resourceAttributes, settings.sendInstanceId);
+    const auto encoder = arguments.dryRun == kRaw ? settings.output->makeEncoder(resources)
+                                                  : makeTextEncoder(resources);
+    return dryRun(configuration, *encoder);
   }
   const auto settings = readForwarderSettings(environment);
   if (const auto* error = std::get_if<LaunchError>(&settings)) return complain(*error);
@@ -255,15 +261,19 @@ int run(const Arguments& arguments) {
 int main(int argc, char** argv) {
   tessel::prepareProcess();
   tessel::blockSignal(SIGTERM);
-  CLI::App app("Ships the events of the spool to an OpenTelemetry collector (OTLP/HTTP, JSON).");
+  CLI::App app(
+      "Ships the events of the spool to an OpenTelemetry collector (OTLP over HTTP),\nor as NDJSON "
+      "to any URL.");
   app.set_version_flag("--version", "statora_forwarder " TESSEL_VERSION, "Print the version");
   app.footer(
       "Where to is OTEL_EXPORTER_OTLP_ENDPOINT's to say. See what would be sent:\n  "
       "statora_forwarder --dry-run");
   tessel::Arguments arguments;
   auto* const once = app.add_flag("--once", arguments.once, "Deliver what waits now, then end");
-  auto* const dryRun = app.add_flag("--dry-run", arguments.dryRun,
-                                    "Print the bodies of the requests; send and change nothing");
+  auto* const dryRun =
+      app.add_flag("--dry-run{text}", arguments.dryRun,
+                   "Print what would be sent; send and change nothing. =raw: the very bytes")
+          ->check(CLI::IsMember({tessel::kText, tessel::kRaw}));
   auto* const requeue = app.add_flag("--requeue", arguments.requeue,
                                      "Let what was set aside wait for delivery again, then end");
   once->excludes(dryRun, requeue);

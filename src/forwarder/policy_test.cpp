@@ -6,6 +6,8 @@
 
 #include "forwarder/Encoder.h"
 
+#include "forwarder/Otlp.h"
+
 namespace tessel {
 namespace {
 
@@ -30,12 +32,21 @@ TEST(PolicyTest, EveryStatusHasItsVerdict) {
   }
 }
 
-TEST(OtlpJsonTest, OnlyAnAnswerOfTheProtocolIsASuccess) {
+TEST(OtlpAnswerTest, OnlyAnAnswerOfTheProtocolIsASuccess) {
+  using namespace std::string_view_literals;
   const struct {
-    const char* body;
+    std::string_view body;
     std::optional<uint64_t> rejected;
     const char* message;
   } cases[] = {
+      {"\x0a\x07\x08\x07\x12\x03why"sv, 7, "why"},
+      {"\x0a\x00"sv, 0, ""},
+      {"\x12\x01x\x0a\x02\x08\x02"sv, 2, ""},
+      {"\x0a\x0b\x08\xff\xff\xff\xff\xff\xff\xff\xff\xff\x01"sv, 0, ""},
+      {"\x12\x01x"sv, {}, ""},
+      {"\x0a\x05\x08\x07"sv, {}, ""},
+      {"\x0a\x02\x08\xff"sv, {}, ""},
+      {"OK"sv, {}, ""},
       {R"({"partialSuccess":{"rejectedLogRecords":"7","errorMessage":"why"}})", 7, "why"},
       {R"({"partialSuccess":{"rejectedLogRecords":7},"later":1})", 7, ""},
       {R"({"partialSuccess":{"errorMessage":"a warning"}})", 0, "a warning"},
@@ -49,15 +60,14 @@ TEST(OtlpJsonTest, OnlyAnAnswerOfTheProtocolIsASuccess) {
       {"<html>", {}, ""},
       {R"({"partialSuccess":{"rejectedLogRecords":"7")", {}, ""},
   };
-  const auto encoder = outputFormats().front()->makeEncoder({});
   for (const auto& c : cases) {
-    const auto told = encoder->readSuccess("application/json", c.body);
+    const auto told = readOtlpSuccess("application/json", c.body);
     ASSERT_EQ(told.has_value(), c.rejected.has_value()) << c.body;
     if (!told) continue;
     EXPECT_EQ(told->rejected, *c.rejected) << c.body;
     EXPECT_EQ(told->message, c.message) << c.body;
   }
-  EXPECT_FALSE(encoder->readSuccess("text/html", "{}"));
+  EXPECT_FALSE(readOtlpSuccess("text/html", "{}"));
 }
 
 TEST(PolicyTest, WordsOfACollectorAreFitForATerminal) {

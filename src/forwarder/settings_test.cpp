@@ -41,6 +41,9 @@ TEST(ForwarderSettingsTest, TheLogsEndpointComesFirst) {
       {{{"OTEL_EXPORTER_OTLP_ENDPOINT", "https://c.example/otlp//"}},
        "https://c.example/otlp/v1/logs"},
       {{{"OTEL_EXPORTER_OTLP_LOGS_ENDPOINT", "https://l.example/x"}}, "https://l.example/x"},
+      {{{"OTEL_EXPORTER_OTLP_ENDPOINT", "https://l.example/x/?a=b/"},
+        {"TESSEL_FORWARD_FORMAT", "ndjson"}},
+       "https://l.example/x/?a=b/"},
       {{{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://127.0.0.1:4318"}}, "http://127.0.0.1:4318/v1/logs"},
       {{{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://[::1]:4318"}}, "http://[::1]:4318/v1/logs"},
       {{{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://c.example"}, {"TESSEL_FORWARD_ALLOW_HTTP", "1"}},
@@ -83,7 +86,7 @@ TEST(ForwarderSettingsTest, ErrorsNameNoSecrets) {
       {"OTEL_EXPORTER_OTLP_HEADERS", "hi:dden=a"},
       {"OTEL_EXPORTER_OTLP_TIMEOUT", "0"},
       {"OTEL_EXPORTER_OTLP_TIMEOUT", "10s"},
-      {"OTEL_EXPORTER_OTLP_PROTOCOL", "http/protobuf"},
+      {"OTEL_EXPORTER_OTLP_PROTOCOL", "grpc"},
       {"TESSEL_FORWARD_INTERVAL", "0"},
       {"TESSEL_FORWARD_ALLOW_HTTP", "yes"},
   };
