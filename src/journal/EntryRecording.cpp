@@ -96,7 +96,7 @@ std::string readAt(int fd, off_t offset, size_t count) {
 Id128 randomId() {
   Id128 id{};
   // The result is not checked: the kernel never returns fewer bytes than were asked for, up to 256.
-  static_cast<void>(::getrandom(id.data(), id.size(), 0));
+  [[maybe_unused]] const ssize_t got = ::getrandom(id.data(), id.size(), 0);
   return id;
 }
 
