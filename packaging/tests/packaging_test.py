@@ -216,7 +216,7 @@ class Texts(unittest.TestCase):
 
     def test_scripts(self):
         scripts = [path for kind in ("postinst", "prerm", "postrm") for path in glob.glob(os.path.join(ROOT, "debian", "*." + kind))]
-        folders = [os.path.join(ROOT, name) for name in ("", ".ci", "scripts", "tests", "examples", "packaging")]
+        folders = [os.path.join(ROOT, name) for name in ("", ".ci", "scripts", "tests", "examples", "examples/fleet", "packaging")]
         for path in sorted(path for folder in folders for path in glob.glob(os.path.join(folder, "*"))):
             if os.path.isfile(path) and os.access(path, os.X_OK):
                 with open(path, "rb") as script:
