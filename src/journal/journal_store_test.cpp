@@ -15,7 +15,7 @@
 #include "journal/ExportEntryStream.h"
 #include "journal/JournalFormat.h"
 #include "journal/LossTokenizer.h"
-#include "journal/testing/JournalDamage.h"
+#include "journal/testing/JournalBender.h"
 #include "journal/testing/JournalOracle.h"
 #include "journal/testing/JournalWriter.h"
 #include "os/testing/TemporaryDirectory.h"

@@ -1,8 +1,7 @@
 #!/usr/bin/env python3
 """Our journal reader beside libsystemd and journalctl, on what the journal's own tools write.
 
-Runs beside a live daemon (see with-journald). TESSEL_RECOVERY_MB=100 makes the damaged files as large
-as they are before a release.
+Runs beside a live daemon (see with-journald).
 """
 
 import argparse
@@ -14,7 +13,6 @@ import re
 import shutil
 import signal
 import socket
-import struct
 import subprocess
 import sys
 import tempfile
@@ -23,7 +21,6 @@ import time
 import unittest
 
 OPTIONS = None
-RECOVERY_MB = int(os.environ.get("TESSEL_RECOVERY_MB", "8"))
 LIVE = "/var/log/journal"
 START = 1_795_300_000_000_000
 
@@ -102,58 +99,6 @@ class Files(ReadingTest):
         result = read(self.folder, "--ours", user=65534, group=65534, extra_groups=[])
         self.assertEqual(result.figures["entries"], 10)
         self.assertIn(f"skipped {hidden}: Permission denied", result.stdout)
-
-
-class Recovery(ReadingTest):
-    """Of a large file, all that is still there comes back."""
-
-    def word(self, place):
-        return struct.unpack_from("<Q", self.journal, place)[0]
-
-    def arrays(self):
-        place = self.word(176)
-        while place:
-            yield place
-            place = self.word(place + 16)
-
-    def entry_ends(self, compact):
-        form, width = ("I", 4) if compact else ("Q", 8)
-        for array in self.arrays():
-            count = (self.word(array + 8) - 24) // width
-            for place in struct.unpack_from(f"<{count}{form}", self.journal, array + 24):
-                if place:
-                    yield place + self.word(place + 8)
-
-    def assert_comes_back(self, name, journal, least):
-        path = os.path.join(self.folder, "hurt.journal")
-        with open(path, "wb") as file:
-            file.write(journal)
-        figures = read(path, "--ours").figures
-        print(f"{RECOVERY_MB} MB, {name}: {figures['entries']} of {self.count}")
-        self.assertGreaterEqual(figures["entries"], least, name)
-        self.assertEqual(figures["repeated"], 0, name)
-
-    def test_what_is_not_damaged_comes_back_once(self):
-        for compact in (False, True):
-            self.count = RECOVERY_MB * 950
-            with open(self.make(f"{compact}.journal", exported(self.count), compact, compress=False), "rb") as file:
-                self.journal = bytearray(file.read())
-            rng = random.Random(1)
-            for array in list(self.arrays()):
-                kept = bytes(self.journal[array:array + 24])
-                self.journal[array:array + 24] = bytes(24)
-                self.assert_comes_back("array header zeroed", self.journal, self.count)
-                self.journal[array:array + 24] = kept[:16] + struct.pack("<Q", array)
-                self.assert_comes_back("array linked to itself", self.journal, self.count)
-                self.journal[array:array + 24] = kept
-            hurt = bytearray(self.journal)
-            for _ in range(RECOVERY_MB):
-                hurt[rng.randrange(4096, len(hurt))] = rng.randrange(256)
-            self.assert_comes_back(f"{RECOVERY_MB} bytes overwritten", hurt, self.count * 0.999)
-            last = self.word(136)
-            end = last + self.word(last + 8) - 16384
-            before = sum(place <= end for place in self.entry_ends(compact))
-            self.assert_comes_back("cut by 16 KiB", self.journal[:end], before)
 
 
 class Live(ReadingTest):
@@ -274,7 +219,6 @@ class Live(ReadingTest):
             self.assertGreaterEqual(result.figures["entries"], least)
             self.assertEqual(result.figures["repeated"], 0)
             self.assertNotIn("problem", result.stdout)
-
 
 
 if __name__ == "__main__":

@@ -4,9 +4,9 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <cstring>
 
 #include "journal/JournalFormat.h"
-#include "journal/testing/JournalDamage.h"
 
 namespace tessel::testing {
 
@@ -19,6 +19,10 @@ uint64_t wordAt(const std::string& file, uint64_t at) {
 }
 
 }  // namespace
+
+void put(std::string& file, uint64_t at, uint64_t value) {
+  std::memcpy(file.data() + at, &value, sizeof value);
+}
 
 JournalBender::JournalBender(std::string file, bool compact)
     : file_(std::move(file)), compact_(compact) {

@@ -16,6 +16,9 @@
 
 namespace tessel::testing {
 
+// Writes the word at an offset of a file that is held in memory.
+void put(std::string& file, uint64_t at, uint64_t value);
+
 class JournalBender {
  public:
   // REQUIRES: `file` is a whole journal. `compact` tells its layout.

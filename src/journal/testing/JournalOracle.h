@@ -30,7 +30,9 @@ class RecordingTokenizer final : public FieldTokenizer {
   std::vector<std::string_view> marks() const override { return marks_; }
   bool wants(std::string_view) const override { return true; }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
-  uint32_t generation() const override { return 0; }
+  uint32_t generation() const override { return newGenerations ? generation_++ : 0; }
+
+  bool newGenerations = false;  // whether all tokens become void with each entry
 
   const std::string& text(FieldToken token) const { return texts_.at(token - 1); }
   // How often any text was shown.
@@ -41,6 +43,7 @@ class RecordingTokenizer final : public FieldTokenizer {
   std::map<std::string, FieldToken, std::less<>> tokens_;
   std::vector<std::string> texts_;
   size_t shown_ = 0;
+  mutable uint32_t generation_ = 0;
 };
 
 // All entries from the current place of a stream to its end.
