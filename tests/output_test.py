@@ -17,9 +17,9 @@ import harness
 from harness import BIN, MachineTest, point
 
 HOSTILE = ["\x1b[31mred", "\x1b]0;title\x07", "\u009b31m", "\u202eright-to-left", "%s%n%llu", "two\nlines", "tab\tand\rreturn",
-           "\x7fdelete", "caf\udce9", "\u2028separator"]
-# Control characters that no recorded text may bring to a terminal. Line feeds are tested elsewhere.
-OBEYED = re.compile("[\x00-\x09\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028\u2029\u202a-\u202e\u2066-\u2069\udc80-\udcff]")
+           "\x7fdelete", "caf\udce9", "\u2028separator", "no\u200bwidth", "t\U000e0041g"]
+# Characters that no recorded text may bring to a terminal. Line feeds are tested elsewhere.
+OBEYED = re.compile("[\x00-\x09\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028\u2029\u202a-\u202e\u200b\u2066-\u2069\U000e0041\udc80-\udcff]")
 COLOUR = re.compile("\x1b\\[[0-9]{1,2}m")
 EPOCH = datetime.datetime(1970, 1, 1, tzinfo=datetime.timezone.utc)
 MICROSECOND = datetime.timedelta(microseconds=1)
@@ -28,7 +28,7 @@ MICROSECOND = datetime.timedelta(microseconds=1)
 def unescaped(text):
     """The recorded text that is shown as `text`; bytes that are not UTF-8 become what JSON has for them."""
     raw = re.sub(rb"\\x([0-9a-f]{2})", lambda found: bytes([int(found[1], 16)]), text.encode("utf-8", "surrogateescape"))
-    return re.sub(r"\\u([0-9a-f]{4})", lambda found: chr(int(found[1], 16)), raw.decode("utf-8", "replace"))
+    return re.sub(r"\\(?:U([0-9a-f]{8})|u([0-9a-f]{4}))", lambda found: chr(int(found[1] or found[2], 16)), raw.decode("utf-8", "replace"))
 
 
 def hostile_points():

@@ -33,9 +33,9 @@ char shortEscape(char32_t point) {
 }
 
 // JSON requires escapes for the C0 controls. DEL is escaped with them, because every other reader
-// takes it for a control too. JSON allows the C1 controls and the marks of direction as they are,
-// but a terminal obeys them, so for a terminal they are escaped as well. A parser reads the same
-// string either way, and `tesselctl --json` on a screen is as safe as the tables.
+// takes it for a control too. JSON allows the C1 controls and characters that nobody sees as they
+// are. For a terminal they are escaped as well: a parser reads the same string either way, and
+// `tesselctl --json` on a screen is as safe as the tables.
 bool isEscaped(char32_t point, bool forTerminal) {
   return point < 0x20 || point == 0x7f || (forTerminal && isObeyed(point));
 }
@@ -76,7 +76,7 @@ void appendJsonString(std::string& out, std::string_view text, bool forTerminal)
 }
 
 // In valid JSON a bare C0 control can only stand between tokens, where a space means the same. Any
-// other character that a terminal obeys can only stand in a string, where an escape means the same.
+// other unseen character can only stand in a string, where an escape means the same.
 JsonWriter& JsonWriter::raw(std::string_view json) {
   separate();
   if (!style_.forTerminal) {

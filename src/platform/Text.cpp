@@ -35,15 +35,6 @@ Sequence sequenceOf(unsigned lead) {
 
 unsigned byteAt(std::string_view text, size_t at) { return static_cast<unsigned char>(text[at]); }
 
-void appendByteEscapes(std::string& out, std::string_view bytes) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  for (size_t at = 0; at < bytes.size(); ++at) {
-    out += "\\x";
-    out += kDigits[byteAt(bytes, at) >> 4];
-    out += kDigits[byteAt(bytes, at) & 0xf];
-  }
-}
-
 // [U+200B], with at least four digits as Unicode writes them.
 void appendNumber(std::string& out, char32_t point) {
   constexpr std::string_view kDigits = "0123456789ABCDEF";
@@ -52,6 +43,16 @@ void appendNumber(std::string& out, char32_t point) {
     if (shift < 16 || point >> shift != 0) out += kDigits[(point >> shift) & 0xf];
   }
   out += "]";
+}
+
+void appendHex(std::string& out, char32_t number, int digits) {
+  constexpr std::string_view kDigits = "0123456789abcdef";
+  for (int shift = 4 * (digits - 1); shift >= 0; shift -= 4)
+    out += kDigits[(number >> shift) & 0xf];
+}
+
+void appendByteEscapes(std::string& out, std::string_view bytes) {
+  for (size_t at = 0; at < bytes.size(); ++at) appendHex(out += "\\x", byteAt(bytes, at), 2);
 }
 
 struct Range {
@@ -70,14 +71,6 @@ constexpr Range kUnseen[] = {
     {0xffa0, 0xffa0},   {0xfff0, 0xfffb},   {0x13430, 0x1343f}, {0x1bca0, 0x1bca3},
     {0x1d173, 0x1d17a}, {0xe0000, 0xe0fff},
 };
-
-bool isUnseen(char32_t point) {
-  if (isControl(point)) return true;
-  // Almost every character is below the first range.
-  if (point < kUnseen[0].first) return false;
-  return std::ranges::any_of(
-      kUnseen, [point](const Range& range) { return point >= range.first && point <= range.last; });
-}
 
 std::string_view markupFor(char32_t point) {
   switch (point) {
@@ -117,20 +110,24 @@ Character firstCharacter(std::string_view rest) {
   return {rest.substr(0, sequence.length), point, true};
 }
 
-// Terminals obey the C1 controls in UTF-8, too: U+009B begins a sequence just as ESC [ does. U+2028
-// and U+2029 break a line. The others set the direction of what follows: behind U+202E a terminal
-// shows the rest of the line backwards, so that a recorded name could pass itself off as another
-// one or hide the verdict beside it.
+// Terminals obey the C1 controls in UTF-8, too: U+009B begins a sequence just as ESC [ does. Behind
+// U+202E a terminal shows the rest of the line backwards, so that a recorded name could pass itself
+// off as another one or hide the verdict beside it. Two names that look the same may differ by a
+// character that nobody sees, and a whole sentence can hide in characters of the tags block.
 bool isObeyed(char32_t point) {
-  return isControl(point) || point == 0x2028 || point == 0x2029 || point == 0x061c ||
-         point == 0x200e || point == 0x200f || (point >= 0x202a && point <= 0x202e) ||
-         (point >= 0x2066 && point <= 0x2069);
+  if (isControl(point)) return true;
+  // Almost every character is below the first range.
+  if (point < kUnseen[0].first) return false;
+  return std::ranges::any_of(
+      kUnseen, [point](const Range& range) { return point >= range.first && point <= range.last; });
 }
 
 void appendUnicodeEscape(std::string& out, char32_t point) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  out += "\\u";
-  for (int shift = 12; shift >= 0; shift -= 4) out += kDigits[(point >> shift) & 0xf];
+  if (point > 0xffff) {
+    appendHex(out += "\\u", 0xd800 + ((point - 0x10000) >> 10), 4);
+    point = 0xdc00 + (point & 0x3ff);
+  }
+  appendHex(out += "\\u", point, 4);
 }
 
 bool isValidUtf8(std::string_view text) {
@@ -158,10 +155,12 @@ std::string terminalText(std::string_view text) {
       out, text,
       [](const Character& character) { return character.valid && !isObeyed(character.point); },
       [&](const Character& character) {
-        if (character.valid && !isControl(character.point))
-          appendUnicodeEscape(out, character.point);
-        else
+        if (!character.valid || isControl(character.point))
           appendByteEscapes(out, character.bytes);
+        else if (character.point > 0xffff)
+          appendHex(out += "\\U", character.point, 8);
+        else
+          appendHex(out += "\\u", character.point, 4);
       });
   return out;
 }
@@ -201,16 +200,15 @@ std::string shortPlainText(std::string_view text, size_t maximum) {
   return plain.substr(0, head).append(kLeftOut).append(plain, tail);
 }
 
-// Two names that look the same may differ by a character that nobody sees, and a whole sentence can
-// hide in characters of the tags block. A control below U+0020 has a picture in Unicode, at U+2400
-// plus its number. The others have none, so we show their numbers.
+// A control below U+0020 has a picture in Unicode, at U+2400 plus its number. The others have none,
+// so we show their numbers.
 std::string visibleText(std::string_view text) {
   constexpr char32_t kControlPictures = 0x2400;
   std::string out;
   out.reserve(text.size());
   appendEscaped(
       out, text,
-      [](const Character& character) { return character.valid && !isUnseen(character.point); },
+      [](const Character& character) { return character.valid && !isObeyed(character.point); },
       [&](const Character& character) {
         if (!character.valid) {
           out += kReplacementCharacter;

@@ -63,6 +63,8 @@ TEST(TextTest, NothingReachesATerminalThatItObeys) {
       // NOLINTNEXTLINE(misc-misleading-bidirectional): what must not reach a terminal
       {"\u202eabc\u2066", "\\u202eabc\\u2066"},
       {"\u2028", "\\u2028"},
+      {"a\u200bb\u00a0c\ufe0f\U000e0041\U0001f600",
+       "a\\u200bb\\u00a0c\\ufe0f\\U000e0041\U0001f600"},
   };
   for (const auto& [text, shown] : cases) EXPECT_EQ(terminalText(text), shown);
   EXPECT_EQ(plainText("a\nb\tc\u2028\u0085\xff", "|"), "a|b\tc\u2028\\xc2\\x85\\xff");
