@@ -76,6 +76,23 @@ uint64_t spaceOfDelivered(const SpooledEvent& event, std::string_view destinatio
   return spaceOfDelivered(event.name.size() + event.payload.size() + destination.size());
 }
 
+// `row` makes a row of its event, which stands in four columns from `first` on.
+template <typename Row, typename MakeRow>
+std::vector<Row> readRows(SqliteStatement& select, int64_t after, size_t maxRows, size_t maxBytes,
+                          int first, MakeRow&& row) {
+  std::vector<Row> rows;
+  size_t bytes = 0;
+  select.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
+  while (bytes < maxBytes && select.step() == SqliteStatement::Step::row) {
+    SpooledEvent event{select.integer(first), select.integer(first + 1),
+                       std::string(select.text(first + 2)), std::string(select.text(first + 3))};
+    bytes += event.name.size() + event.payload.size();
+    rows.push_back(row(std::move(event)));
+  }
+  select.reset();
+  return rows;
+}
+
 }  // namespace
 
 uint64_t spaceOfRow(size_t textBytes) {
@@ -112,33 +129,18 @@ SqliteStatus writeSpoolLimits(SqliteDatabase& database, const SpoolLimits& limit
 
 std::vector<SpooledEvent> readEvents(SqliteStatement& select, int64_t after, size_t maxRows,
                                      size_t maxBytes) {
-  std::vector<SpooledEvent> events;
-  size_t bytes = 0;
-  select.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
-  while (bytes < maxBytes && select.step() == SqliteStatement::Step::row) {
-    events.push_back({select.integer(0), select.integer(1), std::string(select.text(2)),
-                      std::string(select.text(3))});
-    bytes += events.back().name.size() + events.back().payload.size();
-  }
-  select.reset();
-  return events;
+  return readRows<SpooledEvent>(select, after, maxRows, maxBytes, 0,
+                                [](SpooledEvent event) { return event; });
 }
 
 std::vector<DeliveredEvent> readDelivered(SqliteStatement& select, int64_t after, size_t maxRows,
                                           size_t maxBytes) {
-  std::vector<DeliveredEvent> rows;
-  size_t bytes = 0;
-  select.bind(1, after).bind(2, static_cast<int64_t>(maxRows));
-  while (bytes < maxBytes && select.step() == SqliteStatement::Step::row) {
-    rows.push_back({.number = select.integer(0),
-                    .at = select.integer(5),
-                    .destination = std::string(select.text(6)),
-                    .event = {select.integer(1), select.integer(2), std::string(select.text(3)),
-                              std::string(select.text(4))}});
-    bytes += rows.back().event.name.size() + rows.back().event.payload.size();
-  }
-  select.reset();
-  return rows;
+  return readRows<DeliveredEvent>(select, after, maxRows, maxBytes, 1, [&](SpooledEvent event) {
+    return DeliveredEvent{.number = select.integer(0),
+                          .at = select.integer(5),
+                          .destination = std::string(select.text(6)),
+                          .event = std::move(event)};
+  });
 }
 
 SqliteStatus DeliveredRows::make() {

@@ -40,14 +40,8 @@ static int act(const char* word) {
       return tessel_animation_end(token, &point, strtod(next_word(), NULL));
     case 'r':
       return event_in(strtol(next_word(), NULL, 10));
-    case 'z':
-      shrink_sockets(4096);
-      return 0;
-    case 'o':
-      tessel_enable(next_word()[0] == '1');
-      return 0;
     default:
-      return -1;
+      return act_on_process(word);
   }
 }
 
@@ -80,11 +74,6 @@ static int run_line(void) {
 }
 
 int main(void) {
-  while (fgets(line, sizeof line, stdin)) {
-    const int answer = run_line();
-    if (answer == -2) break;
-    printf("%d\n", answer);
-    fflush(stdout);
-  }
+  run_lines(run_line);
   return 0;
 }

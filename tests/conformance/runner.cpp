@@ -84,14 +84,8 @@ int act(const Point& point, const char* word) {
       }
       return failed;
     }
-    case 'z':
-      shrink_sockets(4096);
-      return 0;
-    case 'o':
-      tessel_enable(next_word()[0] == '1');
-      return 0;
     default:
-      return -1;
+      return act_on_process(word);
   }
 }
 
@@ -116,11 +110,4 @@ int runLine() {
 
 }  // namespace
 
-int main() {
-  while (std::fgets(line, sizeof line, stdin)) {
-    const int answer = runLine();
-    if (answer == -2) break;
-    std::printf("%d\n", answer);
-    std::fflush(stdout);
-  }
-}
+int main() { run_lines(runLine); }

@@ -41,4 +41,26 @@ static int go_on_in_child(void) {
   return child == 0;
 }
 
+/* The actions that concern the process and no trace point. */
+static int act_on_process(const char* word) {
+  if (*word == 'z') {
+    shrink_sockets(4096);
+  } else if (*word == 'o') {
+    tessel_enable(next_word()[0] == '1');
+  } else {
+    return -1;
+  }
+  return 0;
+}
+
+/* Answers each line with what `run_line` answers, until there is none, or it answers -2. */
+static void run_lines(int (*run_line)(void)) {
+  while (fgets(line, sizeof line, stdin)) {
+    const int answer = run_line();
+    if (answer == -2) return;
+    printf("%d\n", answer);
+    fflush(stdout);
+  }
+}
+
 #endif
