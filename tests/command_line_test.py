@@ -10,6 +10,7 @@ import time
 
 import harness
 from harness import BIN, MachineTest, export_bytes, log_event, point
+from status_case import CODES
 
 SCRIPT = os.path.join(os.path.dirname(os.path.abspath(__file__)), "../packaging/completion/tesselctl")
 # What the shell does at a press of the key: the framework of Debian, and the function for the program.
@@ -17,6 +18,7 @@ PRESS = """. /usr/share/bash-completion/bash_completion; . "$0"
 COMP_LINE="$*"; COMP_POINT=${#COMP_LINE}; COMP_WORDS=("$@"); COMP_CWORD=$(($# - 1)); COMP_TYPE=9; COMP_KEY=9
 _tesselctl; printf '%s\\n' "${COMPREPLY[@]}"
 """
+VERDICTS = ["reported", "telemetry_disabled", "string_whitelist", "duration", "downsampled", "class_not_supported"]
 COMMANDS = {"record": ["event", "begin", "end"], "explain": [], "compare": [], "events": ["show"], "status": [], "rules": ["check"],
             "defer": ["on", "off"], "tasking": ["on", "off", "show"], "report": []}
 
@@ -58,6 +60,23 @@ class Completion(MachineTest):
             self.assertEqual(self.offered(*words), wanted, words)
         for words in (["explain", "--store", "a"], ["report", "--html", "a"]):
             self.assertEqual(" ".join(self.offered(*words)), "a file", words)
+
+
+class Help(MachineTest):
+    TOLD = {"record": ["4 it could not be handed", "process that records is tesselctl"], "explain": VERDICTS + ["process, its id, its user"],
+            "compare": ["few_values", "needs 11", "not_recorded"], "events": ["id, time, name, time of delivery, destination, payload"],
+            "rules": ["PLATFORM, list, value"], "status": CODES + ["over_share", "exit status", "4 if this user"], "defer": [], "tasking": ["TaskedOn"], "report": []}
+
+    def test_each_answers_alone(self):
+        texts = {command: self.assert_clean(self.machine.ctl(*command.split(), "--help")).out for command in ["", "rules check", *self.TOLD]}
+        for command, text in texts.items():
+            self.assertEqual([line for line in text.splitlines() if len(line) > 80], [], command)
+            for told in ["tesselctl " + command, *self.TOLD.get(command, [])]:
+                self.assertRegex(re.sub(r"\s+", " ", text), "(?i)" + re.escape(told))
+            self.assertIn("Example" if command else "Environment", text)
+        with open(os.path.join(os.path.dirname(SCRIPT), "../man/tesselctl.1"), encoding="utf-8") as file:
+            manual = set(re.findall(r"\bTESSEL_[A-Z_]+|\bTZ\b|NO_COLOR|COLUMNS", file.read().split(".Sh ENVIRONMENT")[1].split(".Sh ")[0]))
+        self.assertEqual(set(re.findall(r"(?m)^  (TESSEL_\w+|TZ|NO_COLOR|COLUMNS) ", "".join(texts.values()))), manual)
 
 
 class Messages(MachineTest):

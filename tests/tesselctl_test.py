@@ -23,15 +23,6 @@ class CtlTest(MachineTest):
 
 
 class Statuses(CtlTest):
-    def test_help_is_narrow_and_has_an_example(self):
-        for command in ("explain", "compare", "events", "rules", "status", "defer", "tasking", "report"):
-            result = self.machine.ctl(command, "--help")
-            self.assertEqual(result.status, 0)
-            self.assertIn("Example", result.out)
-            self.assertIn("tesselctl " + command, result.out)
-            for line in result.out.splitlines():
-                self.assertLessEqual(len(line), 95, line)
-
     def test_without_access_the_hint_says_what_to_do(self):
         harness.require_root()
         self.machine.write_export([log_event("x")])

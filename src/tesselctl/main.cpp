@@ -14,23 +14,23 @@ namespace {
 // The completion of the shell asks with this. It is for nobody else, so --help does not name it.
 constexpr std::string_view kComplete = "--complete";
 
-constexpr const char* kFooter =
-    "Exit status: 0 done; 1 the answer is bad; 2 usage; 4 no access.\n"
-    "'tesselctl COMMAND --help' says more about a command.";
-
-// Help that fits 80 columns. The parser would not break a long description, and a terminal would
-// continue it at the left edge, among the names of the options.
-class NarrowFormatter final : public CLI::Formatter {
- public:
-  NarrowFormatter() { column_width(kColumn); }
-  std::string make_option_desc(const CLI::Option* option) const override {
-    return wrapped(option->get_description(), kWidth - kColumn, 0);
-  }
-
- private:
-  static constexpr size_t kColumn = 28;
-  static constexpr size_t kWidth = 80;
-};
+std::string footer() {
+  return helpTable("What answers which question",
+                   {{"tesselctl explain", "why was this trace point not sent?"},
+                    {"tesselctl rules check WORD", "may I write this word?"},
+                    {"tesselctl events --sent", "what left this machine?"},
+                    {"tesselctl status", "is this machine well?"},
+                    {"tesselctl compare since=-14d,until=-7d last=7d",
+                     "what became slower since last week?"}}) +
+         helpText(
+             "Exit status: 0 done; 1 it could not be done, or the answer is bad; 2 the command "
+             "line "
+             "or the environment makes no sense; 4 no access. Standard output is for a terminal, "
+             "or "
+             "else one record a line; --json is for programs.") +
+         helpEnvironment({"TZ", "COLUMNS", "NO_COLOR"}) +
+         "'tesselctl COMMAND --help' says all about a command, with its variables.";
+}
 
 // Takes the words behind "--" off the arguments. They belong to another program, and the parser
 // would read its options as ours. Absent means no "--"; empty means that nothing followed it.
@@ -60,8 +60,8 @@ int run(std::vector<std::string> arguments) {
   if (arguments.empty() || arguments[0] != kComplete) invocation.command = takeCommand(arguments);
   CLI::App app("Records trace points and shows what tessel_reporter makes of them.", "tesselctl");
   app.require_subcommand(1);
-  app.footer(kFooter);
-  app.formatter(std::make_shared<NarrowFormatter>());
+  app.footer(footer());
+  formatHelp(app);
   addRecordCommand(app, invocation);
   addExplainCommand(app, invocation);
   addCompareCommand(app, invocation);

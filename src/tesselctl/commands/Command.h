@@ -66,6 +66,22 @@ struct CommandText {
   std::string footer;  // notes and examples below the options
 };
 
+// --- What --help tells below the options: notes, then the environment, then examples. A help is at
+// most 80 columns wide.
+
+// Sets how the help of `app`, and of commands that are added later, looks.
+void formatHelp(CLI::App& app);
+// A paragraph, with the empty line behind it.
+std::string helpText(std::string_view text);
+// Names and what they mean, in two columns, with the empty line behind them.
+struct HelpRow {
+  std::string name;
+  std::string meaning;
+};
+std::string helpTable(std::string_view title, const std::vector<HelpRow>& rows);
+// The variables that the command heeds. REQUIRES: Help.cpp knows them.
+std::string helpEnvironment(std::initializer_list<std::string_view> names);
+
 // Adds --color. `invocation` must outlive `app`.
 void addColourOption(CLI::App& app, Invocation& invocation);
 

@@ -189,24 +189,41 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   return warnOfUnreadFiles(comparison.unread, reading->store);
 }
 
-const CommandText kCompare{
-    "compare", "Say what starts or stops being reported, and what became slower",
-    "A setting is one word or several with commas between: usual (nothing changed), internal,\n"
-    "no-internal, a platform (as for --platform), since=DATE, until=DATE,\n"
-    "last=DURATION. Over one period each trace object is judged twice. Over two periods the "
-    "trace\n"
-    "points are compared that are reported at all, and how long each took: what became slower\n"
-    "comes first.\n\n"
-    "Examples:\n"
-    "  tesselctl compare since=-14d,until=-7d last=7d    (which became slower since last week)\n"
-    "  tesselctl compare usual internal\n"
-    "  tesselctl compare Selvin Quarro,internal --last 7d\n"
-    "  tesselctl compare since=yesterday,until=today since=today"};
+CommandText compareText() {
+  return {
+      "compare", "Say what starts or stops being reported, and what became slower",
+      helpText("A setting is one word or several with commas between: usual (nothing changed), "
+               "internal, no-internal, a platform (" +
+               platformNames() +
+               "), since=DATE, until=DATE, last=DURATION. Over one period each trace object is "
+               "judged twice. Over two periods the trace points are compared that are reported at "
+               "all, and how long each took: what became slower comes first.") +
+          helpTable("Changes",
+                    {{"starts", "B reports it and A does not"},
+                     {"stops", "A reports it and B does not"},
+                     {"slower",
+                      "the median or the 95th percentile rose by 5 % or more, and by more than "
+                      "chance makes likely; of a frame rate the median or the 5th fell"},
+                     {"faster", "one of them fell so, and neither rose so"},
+                     {"same", "neither"},
+                     {"few_values", "too few values to tell: a median needs 11 in each period"},
+                     {"only_a, only_b", "it was recorded in one period only"}}) +
+          helpText(
+              "The rule of the other side is the verdict of the setting that does not report "
+              "it ('tesselctl explain --help' lists them), or not_recorded. Without a terminal "
+              "a table is a line of titles and a line for each row, with tabs between.") +
+          helpEnvironment({"TESSEL_TRACE_STORE", "TESSEL_OS_RELEASE", "TZ"}) +
+          "Examples:\n"
+          "  tesselctl compare since=-14d,until=-7d last=7d    (slower since last week)\n"
+          "  tesselctl compare usual internal\n"
+          "  tesselctl compare Selvin Quarro,internal --last 7d\n"
+          "  tesselctl compare since=yesterday,until=today since=today"};
+}
 
 }  // namespace
 
 void addCompareCommand(CLI::App& app, Invocation& invocation) {
-  const auto [command, options] = addCommand(app, invocation, kCompare, runCompare);
+  const auto [command, options] = addCommand(app, invocation, compareText(), runCompare);
   std::vector<std::string> words = {"usual", "internal", "no-internal"};
   const std::vector<std::string> platforms = platformWords();
   words.insert(words.end(), platforms.begin(), platforms.end());

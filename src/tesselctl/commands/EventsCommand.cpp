@@ -238,27 +238,32 @@ int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
 // Rows that -n asks for are kept in memory. Nobody reads more.
 constexpr uint64_t kMostRows = 1'000'000;
 
-const CommandText kEvents{
-    "events", "Show what the spool holds, newest last",
-    "The spool is statora.db in the state directory ($TESSEL_STATE_DIR): one row per event that\n"
-    "the service sent, in order. A row waits until a forwarder has delivered it. Then it stays "
-    "for\n"
-    "7 days, or less where room is needed, with the time and the destination. On a terminal '~'\n"
-    "stands for 'com.vantor.performance.'. In a pipe a row is one line, with tabs between id, "
-    "time,\n"
-    "name, time of delivery, destination and payload. Patterns may hold * and ?.\n\n"
-    "Examples:\n"
-    "  tesselctl events -n 20\n"
-    "  tesselctl events --sent --since yesterday --until today\n"
-    "  tesselctl events show 42\n"
-    "  tesselctl events | grep -c period=week\n"
-    "  tesselctl events --name com.vantor.performance.tessel_reporting_stats --json\n"
-    "  tesselctl events --follow --subsystem com.vantor.Calendar"};
+CommandText eventsText() {
+  return {
+      "events", "Show what the spool holds, newest last",
+      helpText("The spool is statora.db in the state directory: one row per event that the "
+               "service sent, in order. A row waits until a forwarder has delivered it. Then it "
+               "stays for 7 days, or less where room is needed, with the time and the "
+               "destination. On a terminal '~' stands for 'com.vantor.performance.'. Patterns "
+               "may hold *, ? and [...].") +
+          helpText("Without a terminal a row is one line, with tabs between: id, time, name, "
+                   "time of delivery, destination, payload as 'path key=value ...'. While a row "
+                   "waits, time of delivery and destination are empty. How many rows wait and "
+                   "went where goes to standard error.") +
+          helpEnvironment({"TESSEL_STATE_DIR", "TZ"}) +
+          "Examples:\n"
+          "  tesselctl events -n 20\n"
+          "  tesselctl events --sent --since yesterday --until today\n"
+          "  tesselctl events show 42\n"
+          "  tesselctl events | grep -c period=week\n"
+          "  tesselctl events --name '*.tessel_reporting_stats' --json\n"
+          "  tesselctl events --follow --subsystem com.vantor.Calendar"};
+}
 
 }  // namespace
 
 void addEventsCommand(CLI::App& app, Invocation& invocation) {
-  const auto [command, options] = addCommand(app, invocation, kEvents, runEvents);
+  const auto [command, options] = addCommand(app, invocation, eventsText(), runEvents);
   command
       .add_option("--since", options.period.since,
                   "Only events sent since then: 2026-11-22, '2026-11-22 21:45 CET', 21:45, "

@@ -64,8 +64,6 @@ class PayloadBuilder {
   const BootVolumeFacts bootVolume_;
 };
 
-constexpr size_t kFooterWidth = 94;  // as wide as the help text around it
-
 class ExplainRun {
  public:
   ExplainRun(const ExplainOptions& options, const Reading& reading,
@@ -176,24 +174,46 @@ int runExplain(const ExplainOptions& options, const Surroundings& surroundings) 
   return ExplainRun(options, *reading, surroundings).explain();
 }
 
-constexpr char kNotes[] =
-    "Nothing is sent, and neither run marker nor spool is touched. Downsampling begins at zero, "
-    "as\n"
-    "in a service that has just started. Without a period the last 24 hours are read, as in a "
-    "run.\n"
-    "Patterns may hold * and ?. Members of the group systemd-journal may read the journal.\n\n";
-constexpr char kExamples[] =
-    "\n\nExamples:\n"
-    "  tesselctl explain --last 1h --subsystem 'com.vantor.*' --verdict string_whitelist\n"
-    "  tesselctl explain --follow\n"
-    "  tesselctl explain --summary";
+// What a verdict means for the writer of a trace point.
+std::string meaningOf(TesselReporterClassification verdict) {
+  switch (verdict) {
+    case TesselReporterClassificationTelemetryReported:
+      return "it would be sent";
+    case TesselReporterClassificationTelemetryDisabled:
+      return "it is not marked for telemetry (TESSEL_TELEMETRY=1)";
+    case TesselReporterClassificationFailedStringWhitelist:
+      return "a labelled string has a value that stands on no list; 'tesselctl rules' shows them";
+    case TesselReporterClassificationDurationThreshold:
+      return "its duration is negative";
+    case TesselReporterClassificationFailedSCFilter:
+      return "only one in so many of these is sent; 'tesselctl rules' shows the rows";
+    case TesselReporterClassificationClassNotSupported:
+      return "its kind cannot be reported";
+  }
+  return "";
+}
 
 CommandText explainText() {
-  std::string verdicts;
+  std::vector<HelpRow> verdicts;
   for (const auto verdict : kVerdictOrder)
-    verdicts += (verdicts.empty() ? "Verdicts: " : ", ") + std::string(verdictName(verdict));
+    verdicts.push_back({std::string(verdictName(verdict)), meaningOf(verdict)});
   return {"explain", "Say what becomes of each recorded trace point, and why",
-          kNotes + wrapped(verdicts + ".", kFooterWidth, 0) + kExamples};
+          helpText("Nothing is sent, and neither run marker nor spool is touched. Downsampling "
+                   "begins at zero, as in a service that has just started. Without a period the "
+                   "last 24 hours are read, as in a run. Patterns may hold *, ? and [...]. Members "
+                   "of the group systemd-journal may read the journal.") +
+              helpTable("Verdicts", verdicts) +
+              helpText("Without a terminal a trace point is one line, with tabs between: time, "
+                       "verdict, kind (event, interval, animation), subsystem, category, name, "
+                       "reason, duration in seconds, frames per second, name of the process, its "
+                       "id, its user; with --payload the payload. What is not known is empty.") +
+              helpEnvironment({"TESSEL_TRACE_STORE", "TESSEL_OS_RELEASE", "TZ"}) +
+              "Examples:\n"
+              "  tesselctl explain --last 1h --subsystem 'com.vantor.*' \\\n"
+              "    --verdict string_whitelist\n"
+              "  tesselctl explain --follow\n"
+              "  tesselctl explain --summary\n"
+              "  tesselctl explain --last 7d | cut -f 2 | sort | uniq -c"};
 }
 
 std::vector<std::string> verdictWords() {

@@ -27,31 +27,38 @@ namespace tessel::ctl {
 namespace {
 
 constexpr const char* kDescription =
-    "Record a trace point: an event, the begin or the end of an interval, or an interval around a "
-    "command";
+    "Record an event, the begin or end of an interval, or one around a command";
 
-constexpr const char* kFooter =
-    "Examples:\n"
-    "  tesselctl record event com.vantor.Calendar View Open --telemetry --string1 period=week\n"
-    "  tesselctl record begin com.vantor.Render Frame Draw --id 7\n"
-    "  tesselctl record end   com.vantor.Render Frame Draw --id 7 --frame-rate 59.9\n"
-    "  tesselctl record --subsystem com.vantor.Backup --category Job -- rsync -a /home "
-    "/mnt\n\n"
-    "Each line of --stdin is an object with the keys kind (without it: event), subsystem, "
-    "category,\n"
-    "name, telemetry, string1, string2, number1, number2, id, scope, duration, frame_rate,\n"
-    "attributes, fields and message:\n"
-    "  {\"subsystem\": \"com.vantor.Calendar\", \"category\": \"View\", \"name\": \"Open\",\n"
-    "   \"telemetry\": true, \"string1\": {\"period\": \"week\"}, \"number1\": {\"events\": 12}}\n"
-    "A line that cannot be recorded is named by its number, and the next one is read.\n\n"
-    "A begin and its end match on subsystem, category, name and --id, and in process scope on the\n"
-    "process. 'record begin' and 'record end' are two processes, so their scope is 'system' "
-    "unless\n"
-    "--scope says otherwise. 'record -- COMMAND' exits with the status of the command, 128 and "
-    "the\n"
-    "number of the signal that killed it, 127 where it is not found.\n\n"
-    "The process that records is tesselctl itself, around a command too: reports name it, not the\n"
-    "command. TESSEL_TRACE=0 in the environment: nothing is recorded.";
+std::string recordNotes() {
+  return helpText(
+             "A begin and its end match on subsystem, category, name and --id, and in process "
+             "scope on the process. 'record begin' and 'record end' are two processes, so their "
+             "scope is 'system' unless --scope says otherwise.") +
+         helpText(
+             "The process that records is tesselctl itself, around a command too: reports name "
+             "it, not the command.") +
+         helpText(
+             "Each line of --stdin is an object with the keys kind (without it: event), "
+             "subsystem, category, name, telemetry, string1, string2, number1, number2, id, "
+             "scope, duration, frame_rate, attributes, fields and message. A line that cannot "
+             "be recorded is named by its number, and the next one is read.") +
+         helpText(
+             "Exit status: 0 recorded, 2 the point makes no sense, 4 it could not be handed to "
+             "the journal or written. 'record -- COMMAND' exits with the status of the command, "
+             "128 and the number of the signal that killed it, 127 where it is not found, 126 "
+             "where it cannot be run.") +
+         helpEnvironment({"TESSEL_TRACE", "TESSEL_TRACE_WAIT", "TESSEL_JOURNAL_SOCKET"}) +
+         "Examples:\n"
+         "  tesselctl record event com.vantor.Calendar View Open --telemetry \\\n"
+         "    --string1 period=week\n"
+         "  tesselctl record begin com.vantor.Render Frame Draw --id 7\n"
+         "  tesselctl record end   com.vantor.Render Frame Draw --id 7 --frame-rate 59.9\n"
+         "  tesselctl record --subsystem com.vantor.Backup --category Job -- \\\n"
+         "    rsync -a /home /mnt\n"
+         "  echo '{\"subsystem\": \"com.vantor.Calendar\", \"category\": \"View\",\n"
+         "    \"telemetry\": true, \"string1\": {\"period\": \"week\"}}' | tr -d '\\n' |\n"
+         "    tesselctl record --stdin";
+}
 
 // The journal daemon notes who wrote an entry and when. With --store there is no daemon, so these
 // options give the facts. Without them the writer is this process and the time is now.
@@ -311,7 +318,7 @@ int recordCommandLine(const CLI::App& app, const Invocation& invocation,
 void addRecordCommand(CLI::App& app, Invocation& invocation) {
   auto options = std::make_shared<RecordOptions>();
   CLI::App* record = app.add_subcommand("record", kDescription);
-  record->footer(kFooter);
+  record->footer(recordNotes());
   record->require_subcommand(0, 1);
   addKind(*record, invocation, *options, "event", "One moment");
   addKind(*record, invocation, *options, "begin", "An interval begins");

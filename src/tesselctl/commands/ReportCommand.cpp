@@ -85,17 +85,22 @@ int runReport(const ReportOptions& options, const Surroundings& surroundings) {
   return makeReport(options, *reading, facts);
 }
 
-const CommandText kReport{"report", "Make a page about what was recorded, reported and held back",
-                          "One self-contained page. Its figures are those of 'tesselctl explain "
-                          "--summary\n"
-                          "--json' for the same period.\n\n"
-                          "Example:\n"
-                          "  tesselctl report --last 7d --html week.html"};
+CommandText reportText() {
+  return {
+      "report", "Make a page about what was recorded, reported and held back",
+      helpText("One self-contained page. Its figures are those of 'tesselctl explain --summary "
+               "--json' for the same period. A file is replaced in one step and keeps its "
+               "permissions; a new one is yours alone. A link, a device or a pipe is written "
+               "through.") +
+          helpEnvironment({"TESSEL_TRACE_STORE", "TESSEL_STATE_DIR", "TESSEL_OS_RELEASE", "TZ"}) +
+          "Example:\n"
+          "  tesselctl report --last 7d --html week.html"};
+}
 
 }  // namespace
 
 void addReportCommand(CLI::App& app, Invocation& invocation) {
-  const auto [command, options] = addCommand(app, invocation, kReport, runReport);
+  const auto [command, options] = addCommand(app, invocation, reportText(), runReport);
   suggestsFiles(command.add_option("--html", options.html, "File to write, - for standard output"))
       ->required()
       ->type_name("FILE");

@@ -163,23 +163,31 @@ int runRules(const RulesOptions& options, const Surroundings& surroundings) {
   return kDone;
 }
 
-const CommandText kRules{
-    "rules", "Show which words may be written, and check one",
-    "A labelled string is sent only if its value stands on a list of the platform. A build with\n"
-    "internal diagnostics asks no list. In a pipe a record is one line, with tabs between:\n"
-    "  platform      NAME, 'this' or 'other', values known, downsampling rows\n"
-    "  value         PLATFORM, list, value\n"
-    "  special       PLATFORM, subsystem, category, name, list of string 1, list of string 2\n"
-    "  downsampling  PLATFORM, subsystem, category, name (* for any), cap, ratio\n\n"
-    "Examples:\n"
-    "  tesselctl rules | grep -i week\n"
-    "  tesselctl rules check week\n"
-    "  tesselctl rules check com.vantor.Calendar View Open --string1 period=week"};
+CommandText rulesText() {
+  return {
+      "rules", "Show which words may be written, and check one",
+      helpText("A labelled string is sent only if its value stands on a list of the platform. A "
+               "build with internal diagnostics asks no list. A downsampling row lets one in "
+               "'ratio' of its trace points through, and 'cap' at most.") +
+          helpTable(
+              "Without a terminal a record is one line, with tabs between",
+              {{"platform", "NAME, 'this' or 'other', values known, downsampling rows"},
+               {"value", "PLATFORM, list, value"},
+               {"special",
+                "PLATFORM, subsystem, category, name, list of string 1, list "
+                "of string 2"},
+               {"downsampling", "PLATFORM, subsystem, category, name (* for any), cap, ratio"}}) +
+          helpEnvironment({"TESSEL_OS_RELEASE"}) +
+          "Examples:\n"
+          "  tesselctl rules | grep -i week\n"
+          "  tesselctl rules check week\n"
+          "  tesselctl rules check com.vantor.Calendar View Open --string1 period=week"};
+}
 
 }  // namespace
 
 void addRulesCommand(CLI::App& app, Invocation& invocation) {
-  const auto [command, options] = addCommand(app, invocation, kRules, runRules);
+  const auto [command, options] = addCommand(app, invocation, rulesText(), runRules);
   addJudgeOptions(command, options.reading);
   command.add_flag("--json", options.json, "One JSON object a line");
   command.add_flag("--markdown", options.markdown, "A page with the rules of all platforms");
@@ -193,9 +201,11 @@ void addRulesCommand(CLI::App& app, Invocation& invocation) {
       ->type_name("");
   addSlotOptions(*check, "--string", options.strings, "Labelled string");
   check->footer(
-      "The further options are those of 'tesselctl rules'. Exit status: 0 it would pass, or a\n"
-      "part of such trace points would; 1 it would not. In a pipe the answer is one line, with\n"
-      "tabs between 'passes' or 'fails', the verdict, the platform and what decided.\n\n"
+      helpText(
+          "The further options are those of 'tesselctl rules'. Exit status: 0 it would pass, or "
+          "a part of such trace points would; 1 it would not. Without a terminal the answer is "
+          "one line, with tabs between 'passes' or 'fails', the verdict, the platform and what "
+          "decided.") +
       "Examples:\n"
       "  tesselctl rules check --platform Quarro vfs1.root\n"
       "  tesselctl rules check com.vantor.TextInput Keyboard Show");

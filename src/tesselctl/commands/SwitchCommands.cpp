@@ -161,31 +161,36 @@ int taskingOff(const SwitchOptions& options, const Surroundings& surroundings) {
   return switchTasking(options, surroundings, false);
 }
 
-const CommandText kDefer{
-    "defer", "Put the service's runs off, or no longer",
-    "A run that is put off is offered again every 15 minutes. Written is the file 'defer' in "
-    "the\n"
-    "state directory ($TESSEL_STATE_DIR).\n\n"
-    "Example: keep the machine free for a measurement\n"
-    "  tesselctl defer on; ./measure; tesselctl defer off"};
+CommandText deferText() {
+  return {"defer", "Put the service's runs off, or no longer",
+          helpText("A run that is put off is offered again every 15 minutes. Written is the file "
+                   "'defer' in the state directory.") +
+              helpEnvironment({"TESSEL_STATE_DIR", "TESSEL_DEFER_ON"}) +
+              "Example: keep the machine free for a measurement\n"
+              "  tesselctl defer on; ./measure; tesselctl defer off"};
+}
 
-const CommandText kTasking{
-    "tasking", "Switch reporting on or off, or show which it is",
-    "Written is the tasking configuration in the configuration directory ($TESSEL_CONFIG_DIR).\n"
-    "A build with internal diagnostics reports whatever it says.\n\n"
-    "Example: switch reporting on, and see that it is\n"
-    "  sudo tesselctl tasking on\n"
-    "  tesselctl tasking show"};
+CommandText taskingText() {
+  return {
+      "tasking", "Switch reporting on or off, or show which it is",
+      helpText("Written is TaskedOn in com.vantor.performance.tessel_reporter_tasking.json, in "
+               "the configuration directory. A build with internal diagnostics reports whatever "
+               "it says.") +
+          helpEnvironment({"TESSEL_CONFIG_DIR", "TESSEL_OS_RELEASE"}) +
+          "Example: switch reporting on, and see that it is\n"
+          "  sudo tesselctl tasking on\n"
+          "  tesselctl tasking show"};
+}
 
 }  // namespace
 
 void addDeferCommand(CLI::App& app, Invocation& invocation) {
-  addSwitch(app, invocation, kDefer, "One JSON object: defer, changed, file",
+  addSwitch(app, invocation, deferText(), "One JSON object: defer, changed, file",
             {{"on", "Put runs off", deferOn}, {"off", "Let runs take place", deferOff}});
 }
 
 void addTaskingCommand(CLI::App& app, Invocation& invocation) {
-  addSwitch(app, invocation, kTasking, "One JSON object: tasked, source, file",
+  addSwitch(app, invocation, taskingText(), "One JSON object: tasked, source, file",
             {{"on", "Report", taskingOn},
              {"off", "Do not report", taskingOff},
              {"show", "Say whether this machine reports, and what says so", showTasking}});
