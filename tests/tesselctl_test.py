@@ -104,14 +104,6 @@ class Events(CtlTest):
         self.assertEqual((result.returncode, len(result.stdout.splitlines())), (0, len(self.machine.rows())), result.stderr)
         self.assertEqual([name for name in os.listdir(self.machine.state) if name.startswith("statora.db-")], [])
 
-    def test_a_damaged_spool_is_called_that(self):
-        with open(self.spool(), "r+b") as file:
-            file.write(os.urandom(4096))
-        for command in ("events", "status"):
-            result = self.machine.ctl(command)
-            self.assertEqual(result.status, 1)
-            self.assertIn("damaged", (result.out + result.errors).lower())
-
 
 class Status(CtlTest):
     def status(self, **extra):

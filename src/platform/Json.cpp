@@ -40,6 +40,15 @@ bool isEscaped(char32_t point, bool forTerminal) {
   return point < 0x20 || point == 0x7f || (forTerminal && isObeyed(point));
 }
 
+// JSON has escapes of four digits, so a character beyond U+FFFF takes the two of a surrogate pair.
+void appendEscape(std::string& out, char32_t point) {
+  if (point > 0xffff) {
+    appendUnicodeEscape(out, 0xd800 + ((point - 0x10000) >> 10));
+    point = 0xdc00 + (point & 0x3ff);
+  }
+  appendUnicodeEscape(out, point);
+}
+
 template <typename Value>
 std::string_view digits(char (&buffer)[32], Value value) {  // of a double up to 24
   return {buffer, std::to_chars(buffer, std::end(buffer), value).ptr};
@@ -70,7 +79,7 @@ void appendJsonString(std::string& out, std::string_view text, bool forTerminal)
         else if (const char letter = shortEscape(character.point); letter != '\0')
           (out += '\\') += letter;
         else
-          appendUnicodeEscape(out, character.point);
+          appendEscape(out, character.point);
       });
   out += '"';
 }
@@ -89,7 +98,7 @@ JsonWriter& JsonWriter::raw(std::string_view json) {
         if (character.point < 0x20)
           out_ += ' ';
         else
-          appendUnicodeEscape(out_, character.point);
+          appendEscape(out_, character.point);
       });
   return *this;
 }

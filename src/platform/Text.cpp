@@ -122,13 +122,7 @@ bool isObeyed(char32_t point) {
       kUnseen, [point](const Range& range) { return point >= range.first && point <= range.last; });
 }
 
-void appendUnicodeEscape(std::string& out, char32_t point) {
-  if (point > 0xffff) {
-    appendHex(out += "\\u", 0xd800 + ((point - 0x10000) >> 10), 4);
-    point = 0xdc00 + (point & 0x3ff);
-  }
-  appendHex(out += "\\u", point, 4);
-}
+void appendUnicodeEscape(std::string& out, char32_t point) { appendHex(out += "\\u", point, 4); }
 
 bool isValidUtf8(std::string_view text) {
   while (!text.empty()) {
@@ -160,7 +154,7 @@ std::string terminalText(std::string_view text) {
         else if (character.point > 0xffff)
           appendHex(out += "\\U", character.point, 8);
         else
-          appendHex(out += "\\u", character.point, 4);
+          appendUnicodeEscape(out, character.point);
       });
   return out;
 }
