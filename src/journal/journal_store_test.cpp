@@ -95,10 +95,17 @@ TEST(JournalStoreTest, DeliversCopiesInOtherFilesOnce) {
   twice.addSome(1, 1);
   twice.addSome(1, 1);
   directory.write("twice.journal", twice.bytes());
+  // An export is merged with the sequence that its entries are from, not in it.
+  std::string exported;
+  for (const PlainEntry& entry : readStore(directory.path() + "/a.journal").entries)
+    exported += "__CURSOR=" + cursorOf(entry.header) +
+                "\n__REALTIME_TIMESTAMP=" + std::to_string(entry.header.realtime) +
+                "\n__MONOTONIC_TIMESTAMP=" + std::to_string(entry.header.monotonic) + "\n\n";
+  directory.write("a.export", exported);
   const Reading reading = readStore(directory.path());
   EXPECT_EQ(reading.entries.size(), 32u);
   EXPECT_EQ(reading.report.reading.entriesRead, 32u);
-  EXPECT_EQ(reading.report.reading.duplicateEntries, 15u);
+  EXPECT_EQ(reading.report.reading.duplicateEntries, 35u);
 }
 
 // The sequences have overlapping boots and clocks that were set, so no order satisfies all rules.
