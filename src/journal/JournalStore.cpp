@@ -63,7 +63,7 @@ struct JournalStore::State final : EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return merger.header(); }
-  Entry entry() override { return {merger.header(), tokens}; }
+  Entry entry() override { return {merger.header(), {tokens, tokenCount}}; }
 
   void openFiles(StoreFiles found);
   void openFile(StoreFile& file, uint32_t number);
@@ -80,6 +80,10 @@ struct JournalStore::State final : EntryStream {
   }
 
   const TimeRange range;
+  // The tokens of the current entry, and far from here their number. If both stood together, the
+  // compiler would load them with one instruction, which waits for the two that stored them: four
+  // nanoseconds an entry.
+  const FieldToken* tokens = nullptr;
   const StopFlag& stop;
   ServiceStatus* const status;
   uint64_t entriesMerged = 0;
@@ -94,7 +98,7 @@ struct JournalStore::State final : EntryStream {
   std::vector<uint32_t> counters;                 // by file: the same for files of one daemon
   NumberWatch numbers;
   StoreMerger merger;
-  std::span<const FieldToken> tokens;  // of the current entry
+  size_t tokenCount = 0;
 };
 
 bool JournalStore::State::next() {
@@ -111,7 +115,9 @@ bool JournalStore::State::next() {
     ++facts.files[file].entriesRead;
     // The daemon's loss messages end here, so that the user sees only tokens of its own, and so
     // that they are counted even if the user does not look at the entry.
-    tokens = tokenizer.takeOwn(merger.entry().tokens);
+    const std::span<const FieldToken> theirs = tokenizer.takeOwn(merger.entry().tokens);
+    tokens = theirs.data();
+    tokenCount = theirs.size();
     return true;
   }
   return false;
