@@ -84,10 +84,11 @@ def export_bytes(entries, now, first_sequence=1):
         yield b"".join(_field(key, value) for key, value in fields) + b"\n"
 
 
-def in_namespace_argv(var_tmp, command, read_only=(), var_lib=None):
+def in_namespace_argv(var_tmp, command, read_only=(), var_lib=None, machine_id=None):
     # -n: otherwise mount makes /run/mount, on the machine itself.
     script = 'mount -n --bind "$0" /var/tmp && '
     script += f"mount -n --bind {var_lib} /var/lib && " if var_lib else ""
+    script += f"mount -n --bind {machine_id} /etc/machine-id && " if machine_id else ""
     script += "".join(f"mount -n --bind {path} {path} && mount -n -o remount,bind,ro {path} && " for path in read_only)
     script += 'exec "$@"'
     unshare = ["unshare", "--mount"] if os.geteuid() == 0 else ["unshare", "--user", "--map-root-user", "--mount"]
@@ -103,6 +104,7 @@ class Machine:
         self.store, self.state, self.config, self.var_tmp, self.var_lib = folders
         for folder in folders:
             os.mkdir(folder)
+        self.machine_id = None  # another than this machine's
         self.read_only = []  # directories that the programs cannot write to, whoever runs them
         self.now = time.time()
         self.os_release = os.path.join(self.root, "os-release")
@@ -151,13 +153,21 @@ class Machine:
     def start(self, program="tessel_reporter", *arguments, **extra):
         """Starts a program; what it prints goes to files that result() reads."""
         command = in_namespace_argv(self.var_tmp, [os.path.join(BIN, program), *arguments], self.read_only,
-                                    self.var_lib)
+                                    self.var_lib, self.machine_id_file())
         output = tempfile.TemporaryFile()
         errors = tempfile.TemporaryFile()
         process = subprocess.Popen(command, env=self.environment(**extra), stdout=output, stderr=errors,
                                    stdin=subprocess.DEVNULL)
         process.tessel_output, process.tessel_errors = output, errors
         return process
+
+    def machine_id_file(self):
+        if self.machine_id is None:
+            return None
+        path = os.path.join(self.root, "machine-id")
+        with open(path, "w", encoding="utf-8") as file:
+            file.write(self.machine_id + "\n" if self.machine_id else "")
+        return path
 
     def result(self, process, timeout=120):
         """Waits for the program to end by itself; one that does not is killed and fails the test."""

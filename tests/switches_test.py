@@ -45,6 +45,45 @@ class Switches(MachineTest):
         self.machine.set_internal(True)
         self.assertEqual((self.shown()["tasked"], self.shown()["source"]), (True, "internal_build"))
 
+    def test_a_share_of_the_machines_is_switched_on(self):
+        path = os.path.join(self.machine.config, "rollout.json")
+        switched = {}
+        for machine in range(6):
+            self.machine.machine_id = f"{machine + 1:032x}"
+            # The cohort is that of the step before.
+            steps = (["--share", "0%", "--cohort", "spring"], ["--share", "40%"], ["--share", "100.0%"])
+            switched[machine] = [json.loads(self.machine.ctl("tasking", "on", *step, "--json").out) for step in steps]
+        answers = [[step["tasked"] for step in steps] for steps in switched.values()]
+        self.assertEqual({(first, last) for first, _, last in answers}, {(False, True)})
+        self.assertEqual({middle for _, middle, _ in answers}, {False, True}, "some of six machines are in at 40 %")
+        for steps in switched.values():
+            self.assertTrue(all(step["tasked"] == step["in_share"] and step["cohort"] == "spring" for step in steps), steps)
+        self.assertEqual(self.content(), '{"TaskedOn": true}')
+        with open(path, encoding="utf-8") as file:
+            self.assertEqual((json.load(file), os.stat(path).st_mode & 0o777), ({"share": "100%", "cohort": "spring"}, 0o644))
+        self.assertRegex(self.machine.ctl("tasking", "show").out, "100 % of the cohort spring, and this machine is at [0-9.]+ %\n")
+        self.assertEqual(json.loads(self.machine.ctl("status", "--json").out)["tasking"]["share"], 100)
+        self.machine.task('{"TaskedOn": false}')
+        self.assertIn("it does not follow", self.machine.ctl("tasking", "show").out)
+        self.machine.ctl("tasking", "off")
+        self.assertFalse(os.path.exists(path))
+        self.assertNotIn("cohort", self.shown())
+
+    def test_a_share_that_cannot_be_drawn_changes_nothing(self):
+        def refused(status, *arguments):
+            result = self.machine.ctl("tasking", "on", *arguments)
+            self.assertEqual((result.status, os.listdir(self.machine.config)), (status, [TASKING]), arguments)
+            self.assertEqual(self.content(), '{"TaskedOn": false}')
+            return result.errors
+        self.machine.task('{"TaskedOn": false}')
+        for arguments in (["--share", "5"], ["--share", "101%"], ["--share", "-1%"], ["--share", "5%", "--cohort", "a b"],
+                          ["--cohort", "spring"], ["--share"]):
+            self.assertTrue(refused(2, *arguments))
+        self.machine.machine_id = ""
+        self.assertIn("/etc/machine-id", refused(1, "--share", "100%"))
+        self.machine.task("[]")
+        self.assertEqual((self.machine.ctl("tasking", "on", "--share", "5%").status, os.listdir(self.machine.config)), (1, [TASKING]))
+
     def test_other_keys_of_the_configuration_stay(self):
         self.machine.task('{"TaskedOn": false, %s}' % ODD)
         self.assertEqual(self.machine.ctl("tasking", "on").status, 0)

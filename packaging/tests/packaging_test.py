@@ -15,6 +15,8 @@ SYSTEMD = os.path.join(PACKAGING, "systemd")
 REPORTER = os.path.join(SYSTEMD, "tessel-reporter.service")
 FORWARDER = os.path.join(SYSTEMD, "statora-forwarder.service")
 TIMER = os.path.join(SYSTEMD, "tessel-reporter.timer")
+STATUS = os.path.join(SYSTEMD, "tessel-status.service")
+STATUS_TIMER = os.path.join(SYSTEMD, "tessel-status.timer")
 
 
 def run(*command, **options):
@@ -50,11 +52,12 @@ class Units(unittest.TestCase):
     def test_exposure(self):
         self.assertLessEqual(exposure(REPORTER), 0.5)
         self.assertLessEqual(exposure(FORWARDER), 1.2)
+        self.assertLessEqual(exposure(STATUS), 0.5)
 
     def test_verify(self):
         with tempfile.TemporaryDirectory() as directory:
             # The programs and their users are not installed here: stand-ins take their place.
-            for path in (REPORTER, FORWARDER, TIMER):
+            for path in (REPORTER, FORWARDER, TIMER, STATUS, STATUS_TIMER):
                 with open(path, encoding="utf-8") as unit:
                     text = re.sub(r"(?m)^ExecStart=\S+", "ExecStart=/bin/true", unit.read())
                     text = re.sub(r"(?m)^(Documentation|User|Group|SupplementaryGroups)=.*\n", "", text)
@@ -80,6 +83,16 @@ class Units(unittest.TestCase):
                                "MemoryMax": "128M"}.items():
             self.assertEqual(unit.get(setting), [value], setting)
         self.assertIn("WatchdogSec", unit)
+
+    def test_the_status_is_the_services_own_view(self):
+        look, service = settings(STATUS), settings(REPORTER)
+        # Users, mounts and sandbox are the same, so that the look finds what the service finds.
+        own = {"Description", "Documentation", "Type", "ExecStart", "KillSignal", "TimeoutStopSec", "WatchdogSec",
+               "SuccessExitStatus", "TimeoutStartSec", "Environment"}
+        for setting in (set(look) | set(service)) - own:
+            self.assertEqual(look.get(setting), service.get(setting), setting)
+        self.assertEqual(look["SuccessExitStatus"], ["1"])
+        self.assertEqual(settings(STATUS_TIMER)["OnCalendar"], ["*:0/10"])
 
     def test_the_timer_keeps_its_distance(self):
         timer = settings(TIMER)
@@ -236,11 +249,13 @@ class Installed(unittest.TestCase):
             prefix = os.path.join(root, "opt", "tessel")
             units = glob.glob(os.path.join(prefix, "lib", "systemd", "system", "*.service"))
             programs = [program for unit in units for program in settings(unit)["ExecStart"]]
+            programs = [program.split()[0] for program in programs]
             self.assertGreaterEqual(len(programs), 1)
             for manual in glob.glob(os.path.join(prefix, "share", "man", "man8", "*.8")):
                 with open(manual, encoding="utf-8") as page:
                     programs += re.findall(r"(?m)^\.Nm (/\S+)$", page.read())
-            self.assertEqual(len(programs), 2 * len(units))
+            # The manual of tesselctl, which is in the PATH, names no path.
+            self.assertEqual(len(programs), 2 * len(units) - 1)
             for program in programs:
                 self.assertTrue(os.access(root + program, os.X_OK), program)
 

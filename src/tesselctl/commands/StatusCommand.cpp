@@ -3,9 +3,16 @@
 // Scripts act on the exit status, so it is bad exactly where there is a problem. Notes tell what
 // any user of the machine can cause; they do not change it.
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
 #include <functional>
 
+#include "linux/StateDirectory.h"
+#include "os/Files.h"
+#include "statora/SpoolFile.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/ReporterStatus.h"
 #include "tesselctl/showing/Losses.h"
@@ -121,6 +128,7 @@ void writeFindings(JsonWriter& json, std::string_view name, const std::vector<Fi
 std::string statusJson(const ReporterStatus& status) {
   return objectLine([&](JsonWriter& json) {
     json.member("good", status.good());
+    json.member("time", status.now).member("version", TESSEL_VERSION);
     json.array("checked", status.checked, [&](FindingCode code) { json.value(findingName(code)); });
     writeFindings(json, "problems", status.findings, true);
     writeFindings(json, "notes", status.findings, false);
@@ -128,6 +136,10 @@ std::string statusJson(const ReporterStatus& status) {
       json.member("tasked", status.tasking.decision.on());
       json.member("source", taskingSourceName(status.tasking.decision.source()));
       json.member("file", status.tasking.file);
+      if (!status.tasking.rollout) return;
+      json.member("share", status.tasking.rollout->percent());
+      json.member("cohort", status.tasking.rollout->cohort);
+      json.member("in_share", status.tasking.inShare());
     });
     json.object("next_run", [&] {
       json.member("by", nextRunName(status.nextRun.by)).member("at", status.nextRun.at);
@@ -154,12 +166,58 @@ std::string statusJson(const ReporterStatus& status) {
 
 struct StatusOptions {
   bool json = false;
+  bool save = false;
+  std::optional<std::string> prometheus;
 };
+
+// Both programs that use the spool are of the group of its directory, and so must be able to write
+// what we make there. An exporter that reads our metrics is of no group of ours.
+constexpr mode_t kShareWithGroup = 0007;
+constexpr mode_t kShareWithAll = 0022;
+constexpr unsigned kReadableByGroup = 0640;
+constexpr unsigned kReadableByAll = 0644;
+
+// The forwarder believes only files of the directory's owner. A spool of anybody else would be
+// refused by the service.
+std::optional<PlatformError> refusalToSave(const std::string& directory) {
+  struct stat facts {};
+  if (::stat(directory.c_str(), &facts) != 0) return fileError(directory, errno);
+  if (facts.st_uid == ::geteuid()) return {};
+  return PlatformError{ErrorCode::noAccess, directory + ": it belongs to user " +
+                                                std::to_string(facts.st_uid) +
+                                                ", and only its owner can save a status there"};
+}
+
+// A machine that is not tasked has no spool. The forwarder delivers health records from one and
+// cannot make it, because the service would not believe a spool of the forwarder's.
+void makeSpool(const std::string& directory) {
+  const std::string path = directory + "/" + kSpoolFileName;
+  if (::access(path.c_str(), F_OK) == 0) return;
+  SqliteDatabase database;
+  openSpoolDatabase(database, path, 0);
+}
+
+std::optional<PlatformError> writeFiles(const StatusOptions& options,
+                                        const ReporterStatus& status) {
+  if (options.save) {
+    ::umask(kShareWithGroup);
+    if (auto refused = refusalToSave(status.stateDirectory)) return refused;
+    makeSpool(status.stateDirectory);
+    const std::string path = status.stateDirectory + "/" + kSavedStatusName;
+    if (auto failed = replaceFileDurably(path, statusJson(status), kReadableByGroup)) return failed;
+  }
+  if (!options.prometheus) return {};
+  ::umask(kShareWithAll);
+  return replaceFileDurably(*options.prometheus, statusMetrics(status), kReadableByAll);
+}
 
 int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
-  print(options.json ? statusJson(status) : statusScreen(status, surroundings.terminal));
+  const bool toFiles = options.save || options.prometheus;
+  if (options.json || !toFiles)
+    print(options.json ? statusJson(status) : statusScreen(status, surroundings.terminal));
   flushOutput();
+  if (const auto failed = writeFiles(options, status)) return failToWrite(*failed);
   if (status.good()) return kDone;
   // What this user may not see outranks what he sees, since another user may get another answer.
   // The screen is printed first: facts that he may see are worth showing.
@@ -224,6 +282,12 @@ void addStatusCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, statusText(), runStatus);
   command.add_flag("--json", options.json,
                    "One JSON object: good, checked, problems, notes, and the facts");
+  command.add_flag("--save", options.save,
+                   "Keep the JSON as status.json in the state directory, for the forwarder");
+  command
+      .add_option("--prometheus", options.prometheus,
+                  "Replace FILE by metrics, for the node exporter")
+      ->type_name("FILE");
 }
 
 }  // namespace tessel::ctl

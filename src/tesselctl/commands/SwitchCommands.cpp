@@ -28,6 +28,8 @@ constexpr unsigned kReadableByAll = 0644;
 
 struct SwitchOptions {
   bool json = false;
+  // Of "tasking on".
+  std::optional<std::string> share, cohort;
 };
 struct Position {
   const char* name;
@@ -37,8 +39,9 @@ struct Position {
 
 // Lets each position share the options of its command. fallthrough() is what lets --json stand
 // behind the position as well: "tasking show --json".
-void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, const char* json,
-               std::initializer_list<Position> positions) {
+AddedCommand<SwitchOptions> addSwitch(CLI::App& app, Invocation& invocation,
+                                      const CommandText& text, const char* json,
+                                      std::initializer_list<Position> positions) {
   const auto options = std::make_shared<SwitchOptions>();
   CLI::App* command = app.add_subcommand(text.name, text.description);
   command->footer(text.footer);
@@ -49,6 +52,7 @@ void addSwitch(CLI::App& app, Invocation& invocation, const CommandText& text, c
     CLI::App* position = command->add_subcommand(name, description);
     setAction(*position->fallthrough(), invocation, options, take);
   }
+  return {*command, *options};
 }
 
 std::string deferFile(const Surroundings& surroundings) {
@@ -126,6 +130,9 @@ int showTasking(const SwitchOptions& options, const Surroundings& surroundings) 
       json.member("tasked", tasking.decision.on());
       json.member("source", taskingSourceName(tasking.decision.source()));
       json.member("file", tasking.file);
+      if (!tasking.rollout) return;
+      json.member("share", tasking.rollout->percent()).member("cohort", tasking.rollout->cohort);
+      json.member("in_share", tasking.inShare());
     }));
   } else {
     const bool on = tasking.decision.on();
@@ -135,7 +142,24 @@ int showTasking(const SwitchOptions& options, const Surroundings& surroundings) 
   return kDone;
 }
 
-int switchTasking(const SwitchOptions& options, const Surroundings& surroundings, bool on) {
+// Whether this machine belongs to the share, after which the roll-out is noted. The note comes
+// before the answer: without it nobody could say later why a machine reports.
+std::variant<bool, PlatformError> noteRollout(const LaunchConfiguration& launch,
+                                              const std::optional<Rollout>& rollout) {
+  bool in = true;
+  if (rollout) {
+    const auto place = placeOf(machineId().value_or(""), rollout->cohort);
+    if (!place)
+      return PlatformError{ErrorCode::failed,
+                           "/etc/machine-id: this machine has no id that decides; nothing changed"};
+    in = *place < rollout->share;
+  }
+  if (auto failure = writeRollout(launch, rollout)) return std::move(*failure);
+  return in;
+}
+
+int switchTasking(const SwitchOptions& options, const Surroundings& surroundings, bool on,
+                  const std::optional<Rollout>& rollout = {}) {
   const std::string& directory = surroundings.launch.configurationDirectory;
   std::error_code error;
   // is_directory() may report an absent directory as an error. create_directories() clears
@@ -146,7 +170,12 @@ int switchTasking(const SwitchOptions& options, const Surroundings& surroundings
   // The service watches the file and may read it while we write. Half a text is no JSON and gives
   // no answer, so the file is replaced in one step.
   const std::string file = taskingFile(surroundings.launch);
-  const auto changed = changedConfiguration(file, on);
+  // Asked for before anything is written, so that a file we must not touch leaves all as it was.
+  auto changed = changedConfiguration(file, on);
+  if (const auto* refusal = std::get_if<PlatformError>(&changed)) return failToWrite(*refusal);
+  const auto noted = noteRollout(surroundings.launch, rollout);
+  if (const auto* failure = std::get_if<PlatformError>(&noted)) return failToWrite(*failure);
+  if (!std::get<bool>(noted)) changed = changedConfiguration(file, false);
   if (const auto* refusal = std::get_if<PlatformError>(&changed)) return failToWrite(*refusal);
   if (const auto failure = replaceFileDurably(file, std::get<std::string>(changed), kReadableByAll))
     return failToWrite(*failure);
@@ -154,8 +183,21 @@ int switchTasking(const SwitchOptions& options, const Surroundings& surroundings
   // reports even after "off".
   return showTasking(options, surroundings);
 }
+// A share without a cohort is that of the cohort which decided last, so that a greater share takes
+// more of the same machines.
 int taskingOn(const SwitchOptions& options, const Surroundings& surroundings) {
-  return switchTasking(options, surroundings, true);
+  if (!options.share) return switchTasking(options, surroundings, true);
+  const auto share = shareOf(*options.share);
+  if (!share)
+    return fail(kUsage, "--share " + terminalText(*options.share) +
+                            ": give a percentage from 0% to 100%, such as 5% or 0.25%");
+  const auto before = readRollout(surroundings.launch);
+  const std::string cohort =
+      options.cohort.value_or(before ? before->cohort : std::string(kDefaultCohort));
+  if (!isCohortName(cohort))
+    return fail(kUsage, "--cohort " + terminalText(cohort) +
+                            ": give 1 to 64 letters, digits, dots, hyphens or underscores");
+  return switchTasking(options, surroundings, true, Rollout{*share, cohort});
 }
 int taskingOff(const SwitchOptions& options, const Surroundings& surroundings) {
   return switchTasking(options, surroundings, false);
@@ -179,7 +221,9 @@ CommandText taskingText() {
           helpEnvironment({"TESSEL_CONFIG_DIR", "TESSEL_OS_RELEASE"}) +
           "Example: switch reporting on, and see that it is\n"
           "  sudo tesselctl tasking on\n"
-          "  tesselctl tasking show"};
+          "  tesselctl tasking show\n"
+          "Example: begin with one machine in twenty\n"
+          "  sudo tesselctl tasking on --share 5% --cohort spring"};
 }
 
 }  // namespace
@@ -190,10 +234,18 @@ void addDeferCommand(CLI::App& app, Invocation& invocation) {
 }
 
 void addTaskingCommand(CLI::App& app, Invocation& invocation) {
-  addSwitch(app, invocation, taskingText(), "One JSON object: tasked, source, file",
-            {{"on", "Report", taskingOn},
-             {"off", "Do not report", taskingOff},
-             {"show", "Say whether this machine reports, and what says so", showTasking}});
+  const auto [command, options] =
+      addSwitch(app, invocation, taskingText(),
+                "One JSON object: tasked, source, file, and of a roll-out share, cohort, in_share",
+                {{"on", "Report", taskingOn},
+                 {"off", "Do not report", taskingOff},
+                 {"show", "Say whether this machine reports, and what says so", showTasking}});
+  CLI::App* const on = command.get_subcommand("on");
+  CLI::Option* const share = on->add_option(
+      "--share", options.share, "Report only if the machine belongs to this share, such as 5%");
+  on->add_option("--cohort", options.cohort,
+                 "The roll-out that draws the machines, by its name [the last one, else default]")
+      ->needs(share);
 }
 
 }  // namespace tessel::ctl

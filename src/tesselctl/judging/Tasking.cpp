@@ -34,7 +34,9 @@ Tasking askTasking(const LaunchConfiguration& launch) {
     const auto configuration = found.text ? parseConfiguration(*found.text) : nullptr;
     return taskingDecisionForConfiguration(configuration.get(), kTaskingType);
   });
-  return {decision, failure, file};
+  Tasking tasking{decision, failure, file, readRollout(launch), {}};
+  if (tasking.rollout) tasking.place = placeOf(machineId().value_or(""), tasking.rollout->cohort);
+  return tasking;
 }
 
 std::string_view taskingSourceName(TaskingSource source) {
@@ -44,7 +46,9 @@ std::string_view taskingSourceName(TaskingSource source) {
   return kNames[static_cast<size_t>(source)];
 }
 
-std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& launch) {
+namespace {
+
+std::string sourceWords(const Tasking& tasking, const LaunchConfiguration& launch) {
   switch (tasking.decision.source()) {
     case TaskingSource::internalBuild:
       return launch.osReleasePath + " says that this is an internal build";
@@ -61,6 +65,30 @@ std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& laun
   if (::access(tasking.file.c_str(), R_OK) != 0)
     return tasking.file + " may not be read by this user";
   return tasking.file + " does not hold a JSON object with a number or boolean under \"TaskedOn\"";
+}
+
+// Without the zeros at the end: "5 %", "0.25 %".
+std::string percentWords(uint32_t parts) {
+  std::string text = std::to_string(parts / 1e4);
+  text.erase(text.find_last_not_of('0') + 1);
+  if (text.ends_with('.')) text.pop_back();
+  return text + " %";
+}
+
+}  // namespace
+
+std::string taskingWords(const Tasking& tasking, const LaunchConfiguration& launch) {
+  std::string words = sourceWords(tasking, launch);
+  if (!tasking.rollout) return words;
+  words += "; the roll-out takes " + percentWords(tasking.rollout->share) + " of the cohort " +
+           tasking.rollout->cohort;
+  if (!tasking.place) return words + ", and this machine has no id to find its place";
+  words += ", and this machine is at " + percentWords(*tasking.place);
+  // Somebody has changed one of the two files alone.
+  if (tasking.decision.source() == TaskingSource::configuration &&
+      tasking.decision.on() != tasking.inShare())
+    words += ": it does not follow";
+  return words;
 }
 
 }  // namespace tessel::ctl

@@ -4,18 +4,24 @@
 
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 
 #include "linux/LaunchConfiguration.h"
 #include "tasking/TaskingGate.h"
+#include "tesselctl/judging/Rollout.h"
 
 namespace tessel::ctl {
 
 struct Tasking {
   TaskingDecision decision;
-  std::string failure;  // why the file could not be looked at; empty if it could
-  std::string file;     // of the configuration, there or not
+  std::string failure;             // why the file could not be looked at; empty if it could
+  std::string file;                // of the configuration, there or not
+  std::optional<Rollout> rollout;  // the last that decided; absent if none did
+  std::optional<uint32_t> place;   // of this machine in it; absent if it has no machine id
+
+  bool inShare() const { return rollout && place && *place < rollout->share; }
 };
 
 std::string taskingFile(const LaunchConfiguration& launch);

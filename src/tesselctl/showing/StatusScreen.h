@@ -1,4 +1,4 @@
-// The status of this machine as one screen for people. Stateless; any thread.
+// The status of this machine as one screen for people, and as metrics. Stateless; any thread.
 
 #pragma once
 
@@ -11,5 +11,8 @@ namespace tessel::ctl {
 
 // Facts first, then notes, and problems last. Fit for a terminal.
 std::string statusScreen(const ReporterStatus& status, const Terminal& terminal);
+
+// Gauges and counters in the text format of Prometheus.
+std::string statusMetrics(const ReporterStatus& status);
 
 }  // namespace tessel::ctl

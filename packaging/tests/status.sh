@@ -1,0 +1,17 @@
+# shellcheck shell=sh
+# shellcheck disable=SC2154 # $root is the one of try-in-container
+# Sourced by try-in-container: the unit that looks whether all is well, once with metrics.
+
+mkdir -p "$root/etc/systemd/system/tessel-status.service.d"
+printf '[Service]\nEnvironment="TESSEL_STATUS_OPTIONS=--prometheus /srv/metrics/tessel.prom"\nReadWritePaths=/srv/metrics\n' \
+    > "$root/etc/systemd/system/tessel-status.service.d/metrics.conf"
+inside install -d -o tessel-reporter /srv/metrics
+inside systemctl daemon-reload
+check "the timer of the status waits" inside systemctl is-active tessel-status.timer
+check "the status unit looks" inside systemctl start tessel-status.service
+check "it keeps what it found" inside grep -F '"good":true' /var/lib/tessel/status.json
+check "as the service's user" equals "$(inside stat -c '%U %G %a' /var/lib/tessel/status.json)" "tessel-reporter tessel-reporter 640"
+check "metrics are for everyone" equals "$(inside stat -c '%a' /srv/metrics/tessel.prom)" 644
+check "and agree" inside grep -Fx 'tessel_good 1' /srv/metrics/tessel.prom
+inside rm -r /srv/metrics /etc/systemd/system/tessel-status.service.d
+inside systemctl daemon-reload
