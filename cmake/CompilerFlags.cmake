@@ -18,12 +18,13 @@ if(TESSEL_WERROR)
 endif()
 
 # These look at optimised code, and GCC takes strings of its own library that were joined, or optional
-# values, for overruns. With precompiled headers it does so in debug builds, too.
+# values, for overruns. It does so in debug builds, too: with precompiled headers, and from GCC 13 on.
 set(TESSEL_WRONG_AT_TIMES "")
 if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
   set(TESSEL_WRONG_AT_TIMES -Wno-array-bounds -Wno-maybe-uninitialized -Wno-restrict -Wno-stringop-overflow
                             -Wno-stringop-overread)
-  add_compile_options("$<${shipped}:${TESSEL_WRONG_AT_TIMES}>")
+  set(newer $<BOOL:$<VERSION_GREATER_EQUAL:${CMAKE_CXX_COMPILER_VERSION},13>>)
+  add_compile_options("$<$<OR:${shipped},${newer}>:${TESSEL_WRONG_AT_TIMES}>")
 endif()
 
 if(CMAKE_CXX_COMPILER_ID MATCHES "Clang")

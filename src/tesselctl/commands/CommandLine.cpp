@@ -31,15 +31,15 @@ const CLI::App& calledIn(const CLI::App& app) {
 }
 
 // "events show"; the program itself has no path.
-std::string pathOf(const CLI::App& command) {
+std::string commandPath(const CLI::App& command) {
   if (command.get_parent() == nullptr) return "";
-  const std::string outer = pathOf(*command.get_parent());
+  const std::string outer = commandPath(*command.get_parent());
   return (outer.empty() ? "" : outer + " ") + command.get_name();
 }
 
 // How a message begins that is about the command.
 std::string nameOf(const CLI::App& command) {
-  const std::string path = pathOf(command);
+  const std::string path = commandPath(command);
   return path.empty() ? "the command line" : path;
 }
 
@@ -82,7 +82,7 @@ std::string unknownWord(const CLI::App& command, const std::string& word) {
         nameOf(command) + " does not take " + quoted + "; it takes " + joined(inner, ", ");
     // Who leaves out the only word that may stand there meant it.
     if (inner.size() == 1)
-      message += ": tesselctl " + pathOf(command) + " " + inner.front() + " " + word;
+      message += ": tesselctl " + commandPath(command) + " " + inner.front() + " " + word;
     return message;
   }
   const std::string arguments = argumentsOf(command);
@@ -225,7 +225,7 @@ int failToParse(const CLI::App& app, const CLI::ParseError& error, const std::st
   const auto remaining = app.remaining();
   const bool first = !remaining.empty() && remaining.front() == firstWord;
   const CLI::App& command = first ? app : calledIn(app);
-  const std::string path = pathOf(command);
+  const std::string path = commandPath(command);
   return fail(kUsage, messageFor(command, error, app.remaining(true)) + "; see tesselctl " +
                           (path.empty() ? "" : path + " ") + "--help");
 }

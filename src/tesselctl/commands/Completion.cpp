@@ -15,9 +15,9 @@ namespace {
 bool takesValue(const CLI::Option& option) { return option.get_items_expected_max() > 0; }
 
 // Follows the words of a command line to the command, option or argument that the next one is for.
-class Position {
+class PlaceOfWord {
  public:
-  explicit Position(CLI::App& app) : command_(&app) {}
+  explicit PlaceOfWord(CLI::App& app) : command_(&app) {}
 
   void pass(const std::string& word) {
     if (awaited_ != nullptr) {
@@ -91,7 +91,7 @@ class Position {
 }  // namespace
 
 int complete(CLI::App& app, const std::vector<std::string>& words) {
-  Position position(app);
+  PlaceOfWord position(app);
   const std::string begun = words.empty() ? "" : words.back();
   for (size_t i = 0; i + 1 < words.size(); ++i) position.pass(words[i]);
   for (const std::string& word : position.offers(begun)) {

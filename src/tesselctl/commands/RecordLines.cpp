@@ -21,7 +21,7 @@ namespace tessel::ctl {
 
 namespace {
 
-using nlohmann::json;
+using LineJson = nlohmann::json;
 
 // Bytes. The largest point has 32 attributes and a dozen strings of 4 KiB each. JSON may write a
 // byte as six, which makes just over 1 MB. A longer line would only fill our memory.
@@ -74,10 +74,10 @@ class LineReader {
 
 // Reads one value of a JSON object into a point. The answer is what the value should have been, or
 // null where it is that.
-using TakeValue = const char* (*)(RecordedPoint&, const json&);
+using TakeValue = const char* (*)(RecordedPoint&, const LineJson&);
 
 template <auto Member>
-const char* takeText(RecordedPoint& point, const json& value) {
+const char* takeText(RecordedPoint& point, const LineJson& value) {
   if (!value.is_string()) return "a string";
   point.*Member = value.get<std::string>();
   return nullptr;
@@ -85,7 +85,7 @@ const char* takeText(RecordedPoint& point, const json& value) {
 
 // As the recording header writes numbers: a double has 15 digits or, where those do not read back
 // as the same double, 17, and is never taken for an integer.
-std::string decimalOf(const json& number) {
+std::string decimalOf(const LineJson& number) {
   if (!number.is_number_float()) return number.dump();
   const double value = number.get<double>();
   std::array<char, 40> text{};
@@ -102,26 +102,26 @@ std::string decimalOf(const json& number) {
 }
 
 template <auto Member>
-const char* takeNumber(RecordedPoint& point, const json& value) {
+const char* takeNumber(RecordedPoint& point, const LineJson& value) {
   if (!value.is_number()) return "a number";
   point.*Member = decimalOf(value);
   return nullptr;
 }
 
-const char* takeId(RecordedPoint& point, const json& value) {
+const char* takeId(RecordedPoint& point, const LineJson& value) {
   if (!value.is_string() && !value.is_number_integer()) return "a string or an integer";
   point.id = value.is_string() ? value.get<std::string>() : value.dump();
   return nullptr;
 }
 
-const char* takeTelemetry(RecordedPoint& point, const json& value) {
+const char* takeTelemetry(RecordedPoint& point, const LineJson& value) {
   if (!value.is_boolean()) return "true or false";
   point.telemetry = value.get<bool>();
   return nullptr;
 }
 
 template <size_t Slot>
-const char* takeString(RecordedPoint& point, const json& value) {
+const char* takeString(RecordedPoint& point, const LineJson& value) {
   if (!value.is_object() || value.size() != 1 || !value.front().is_string())
     return "{\"LABEL\": \"VALUE\"}";
   point.strings[Slot] = {value.begin().key(), value.front().get<std::string>()};
@@ -129,7 +129,7 @@ const char* takeString(RecordedPoint& point, const json& value) {
 }
 
 template <size_t Slot>
-const char* takeLabelledNumber(RecordedPoint& point, const json& value) {
+const char* takeLabelledNumber(RecordedPoint& point, const LineJson& value) {
   if (!value.is_object() || value.size() != 1 || !value.front().is_number())
     return "{\"LABEL\": NUMBER}";
   point.numbers[Slot] = {value.begin().key(), decimalOf(value.front())};
@@ -138,7 +138,7 @@ const char* takeLabelledNumber(RecordedPoint& point, const json& value) {
 
 // An object of texts. No key holds '=', because that ends a key in the journal.
 template <auto Member>
-const char* takePairs(RecordedPoint& point, const json& value) {
+const char* takePairs(RecordedPoint& point, const LineJson& value) {
   constexpr const char* kExpected = "an object of strings, without '=' in its keys";
   if (!value.is_object()) return kExpected;
   for (const auto& [key, text] : value.items()) {
@@ -180,12 +180,12 @@ std::variant<RecordedPoint, std::string> pointFrom(std::string_view line,
                                                    const RecordedPoint& defaults) {
   // The parser throws, also for a number that no double can hold. No exception may leave this room,
   // and the place in the line is all that helps to find the mistake.
-  json object;
+  LineJson object;
   try {
-    object = json::parse(line);
-  } catch (const json::parse_error& error) {
+    object = LineJson::parse(line);
+  } catch (const LineJson::parse_error& error) {
     return "no JSON at byte " + std::to_string(error.byte);
-  } catch (const json::exception&) {
+  } catch (const LineJson::exception&) {
     return "a number is beyond all doubles";
   }
   if (!object.is_object()) return "no JSON object";
