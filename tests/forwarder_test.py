@@ -108,17 +108,30 @@ class Trouble(ForwarderTest):
         self.assertEqual(self.errors, "statora_forwarder: error: The collector rejected 2 records: too old\n")
         self.assert_all_arrived_once(receiver, 5)
 
-    def test_what_was_rejected_counts_once(self):
+    def test_a_spool_that_cannot_be_written(self):
         self.add(1)
         with Receiver() as receiver:
-            self.run_forwarder(receiver)  # makes the forwarder's tables, so its next write is an acknowledgement
+            self.run_forwarder(receiver)  # makes the forwarder's tables, so its next write is the proof
         self.add(5)
-        body = b'{"partialSuccess":{"rejectedLogRecords":"2","errorMessage":"too old"}}'
-        with Receiver(lambda request, number: Answer(200, body)) as receiver:
-            failed = self.run_forwarder(receiver, **FaultMachine.faults(CALL="pwrite64", PATH="-wal", AT=1, TIMES=1, ERRNO=5))
-            self.assertEqual((failed.returncode, self.run_forwarder(receiver).returncode), (66, 0), self.errors)
-        self.assertEqual(len(receiver.requests), 2)
-        self.assertEqual((self.counters()["delivered"], self.counters()["rejected"]), (6, 2))
+        with Receiver() as receiver:
+            full = self.run_forwarder(receiver, **FaultMachine.faults(CALL="pwrite64", PATH="-wal", AT=1, ERRNO=28))
+            self.assertEqual((full.returncode, receiver.requests), (66, []), "nothing leaves that cannot be acknowledged")
+        other = sqlite3.connect(self.path, isolation_level=None, check_same_thread=False)
+        self.addCleanup(other.close)
+        body = b'{"partialSuccess":{"rejectedLogRecords":"18446744073709551615","errorMessage":"too old"}}'
+
+        def lock(*_):
+            other.execute("BEGIN IMMEDIATE")
+            return Answer(200, body)
+
+        with Receiver(lock) as receiver:
+            process = subprocess.Popen([FORWARDER, "--once"], env=self.environment(receiver), stderr=subprocess.PIPE, text=True)
+            self.assertIn("rejected 5 records", process.stderr.readline())
+            self.assertIn("The spool cannot be used: database is locked", process.stderr.readline())
+            other.execute("COMMIT")
+            process.communicate(timeout=60)
+            self.assertEqual((process.returncode, len(receiver.requests)), (0, 1), "what was taken is not sent again")
+        self.assertEqual((self.counters()["delivered"], self.counters()["rejected"], self.waiting()), (6, 5, 0))
 
     def test_a_newer_spool_is_used_if_it_says_so(self):
         self.add(1)

@@ -3,13 +3,24 @@
 // One handle serves all requests, because it keeps the connection: a TLS handshake costs more than
 // a batch. Redirects are not followed, because a redirect could send events and credentials to a
 // host that nobody configured.
+//
+// A time limit for the whole request would have to guess the speed of the line: within 10 seconds a
+// line of 40 kB/s carries less than a batch, and such a machine would never deliver. So a request
+// ends when no byte has moved for a while. libcurl counts a byte as sent when the kernel has taken
+// it, and the kernel takes a mebibyte at once and sends it for half a minute. So we subtract what
+// the kernel still holds.
 
 #include "forwarder/Collector.h"
 
 #include <curl/curl.h>
+#include <linux/sockios.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
+#include <vector>
 
 #include "platform/Text.h"
 
@@ -56,11 +67,53 @@ std::string mediaTypeOf(CURL* request) {
   return type;
 }
 
-// libcurl calls this about once a second while it waits, and ends the request if the answer is not
-// 0.
-int checkCancelled(void* flag, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
-  return static_cast<const std::atomic<bool>*>(flag)->load() ? 1 : 0;
-}
+// Ends a request that was cancelled or that stands still.
+class Watch {
+ public:
+  Watch(const std::atomic<bool>& cancelled, std::chrono::milliseconds stall)
+      : cancelled_(cancelled), stall_(stall) {}
+
+  void begin() {
+    stalled_ = false;
+    moved_ = -1;
+  }
+  bool stalled() const { return stalled_; }
+
+  // libcurl calls this about once a second while it waits, and ends the request if the answer is
+  // not 0.
+  static int progress(void* self, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent) {
+    return static_cast<Watch*>(self)->goesOn(received + sent) ? 0 : 1;
+  }
+  static curl_socket_t openSocket(void* self, curlsocktype, curl_sockaddr* address) {
+    const int made = ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+    if (made >= 0) static_cast<Watch*>(self)->sockets_.push_back(made);
+    return made;
+  }
+  static int closeSocket(void* self, curl_socket_t socket) {
+    std::erase(static_cast<Watch*>(self)->sockets_, socket);
+    return ::close(socket);
+  }
+
+ private:
+  bool goesOn(curl_off_t bytes) {
+    for (const int socket : sockets_) {
+      int queued = 0;
+      if (::ioctl(socket, SIOCOUTQ, &queued) == 0) bytes -= queued;
+    }
+    const auto now = std::chrono::steady_clock::now();
+    if (bytes != moved_) lastMove_ = now;
+    moved_ = bytes;
+    stalled_ = stall_.count() > 0 && now - lastMove_ >= stall_;
+    return !cancelled_ && !stalled_;
+  }
+
+  const std::atomic<bool>& cancelled_;
+  const std::chrono::milliseconds stall_;
+  std::vector<int> sockets_;
+  curl_off_t moved_ = -1;
+  std::chrono::steady_clock::time_point lastMove_;
+  bool stalled_ = false;
+};
 
 // A gzip stream for one body after another, because its state of 256 KiB is costly to set up.
 class Gzip {
@@ -96,11 +149,13 @@ class Gzip {
 struct CurlCollector::Handles {
   CURL* request = curl_easy_init();
   curl_slist* headers = nullptr;
+  Watch watch;
   Gzip gzip;
   std::string compressed;
   char reason[CURL_ERROR_SIZE] = "";
 
-  Handles() = default;
+  Handles(const std::atomic<bool>& cancelled, std::chrono::milliseconds stall)
+      : watch(cancelled, stall) {}
   Handles(const Handles&) = delete;
   Handles& operator=(const Handles&) = delete;
   ~Handles() {
@@ -115,24 +170,47 @@ struct CurlCollector::Handles {
   void setFile(CURLoption option, const std::string& path) {
     if (!path.empty()) set(option, path.c_str());
   }
-  void setHeaders(const ForwarderSettings& settings, std::string_view contentType) {
-    headers = curl_slist_append(headers, ("Content-Type: " + std::string(contentType)).c_str());
-    // Without this, libcurl would ask before each large body whether it may send it, and wait.
-    headers = curl_slist_append(headers, "Expect:");
-    if (settings.compress) headers = curl_slist_append(headers, "Content-Encoding: gzip");
-    for (const std::string& header : settings.headers)
-      headers = curl_slist_append(headers, header.c_str());
+  void setHeaders(const std::vector<std::string>& lines) {
+    for (const std::string& line : lines) headers = curl_slist_append(headers, line.c_str());
     set(CURLOPT_HTTPHEADER, headers);
+  }
+  void setWatch() {
+    set(CURLOPT_NOPROGRESS, 0L);
+    set(CURLOPT_XFERINFOFUNCTION, &Watch::progress);
+    set(CURLOPT_XFERINFODATA, &watch);
+    set(CURLOPT_OPENSOCKETFUNCTION, &Watch::openSocket);
+    set(CURLOPT_OPENSOCKETDATA, &watch);
+    set(CURLOPT_CLOSESOCKETFUNCTION, &Watch::closeSocket);
+    set(CURLOPT_CLOSESOCKETDATA, &watch);
   }
 };
 
 CurlCollector::CurlCollector(const ForwarderSettings& settings, std::string_view contentType)
-    : compress_(settings.compress), handles_(std::make_unique<Handles>()) {
+    : settings_(settings), contentType_(contentType) {}
+
+CurlCollector::~CurlCollector() = default;
+
+bool CurlCollector::hasNewCredentials() const {
+  return credentialsSeen_ != credentialsMark(settings_);
+}
+
+// A new handle for new credentials: libcurl keeps certificates and connections with the old one.
+// False if the credentials make no sense.
+bool CurlCollector::prepare() {
+  std::string mark = credentialsMark(settings_);
+  if (handles_ && mark == credentialsSeen_) return true;
+  handles_.reset();
+  const auto credentials = readCredentials(settings_);
+  if (!credentials) return false;
+  credentialsSeen_ = std::move(mark);
+  handles_ = std::make_unique<Handles>(cancelled_, settings_.stall);
   Handles& to = *handles_;
-  to.set(CURLOPT_URL, settings.url.c_str());
+  to.set(CURLOPT_URL, settings_.url.c_str());
   to.set(CURLOPT_PROTOCOLS_STR, "http,https");
   to.set(CURLOPT_FOLLOWLOCATION, 0L);
-  to.set(CURLOPT_TIMEOUT_MS, static_cast<long>(settings.timeout.count()));
+  to.set(CURLOPT_TIMEOUT_MS, static_cast<long>(settings_.timeout.count()));
+  // A proxy cannot reach what listens on this machine alone, and would see plain http.
+  if (settings_.loopback) to.set(CURLOPT_NOPROXY, "*");
   // Signals belong to the signal thread; libcurl would use SIGALRM for its timeout.
   to.set(CURLOPT_NOSIGNAL, 1L);
   to.set(CURLOPT_USERAGENT, "statora_forwarder/" TESSEL_VERSION);
@@ -141,22 +219,23 @@ CurlCollector::CurlCollector(const ForwarderSettings& settings, std::string_view
   to.set(CURLOPT_HEADERFUNCTION, &takeHeadLine);
   to.set(CURLOPT_SUPPRESS_CONNECT_HEADERS, 1L);
   to.set(CURLOPT_ERRORBUFFER, to.reason);
-  to.set(CURLOPT_NOPROGRESS, 0L);
-  to.set(CURLOPT_XFERINFOFUNCTION, &checkCancelled);
-  to.set(CURLOPT_XFERINFODATA, &cancelled_);
-  to.setFile(CURLOPT_CAINFO, settings.authorities);
-  to.setFile(CURLOPT_SSLCERT, settings.clientCertificate);
-  to.setFile(CURLOPT_SSLKEY, settings.clientKey);
-  to.setHeaders(settings, contentType);
+  to.setWatch();
+  to.setFile(CURLOPT_CAINFO, credentials->authorities);
+  to.setFile(CURLOPT_SSLCERT, credentials->clientCertificate);
+  to.setFile(CURLOPT_SSLKEY, credentials->clientKey);
+  to.setHeaders(requestHeaders(settings_, *credentials, contentType_));
+  return true;
 }
 
-CurlCollector::~CurlCollector() = default;
-
 CollectorAnswer CurlCollector::post(std::string_view body) {
-  Handles& with = *handles_;
   CollectorAnswer answer;
+  if (!prepare()) {
+    answer.error = "otlp-headers in CREDENTIALS_DIRECTORY is not name=value,name=value";
+    return answer;
+  }
+  Handles& with = *handles_;
   std::string_view sent = body;
-  if (compress_) {
+  if (settings_.compress) {
     if (!with.gzip.compress(body, with.compressed)) {
       answer.error = "the body cannot be compressed";
       return answer;
@@ -165,22 +244,25 @@ CollectorAnswer CurlCollector::post(std::string_view body) {
   }
   Reading reading;
   with.reason[0] = '\0';
+  with.watch.begin();
   with.set(CURLOPT_POSTFIELDS, sent.data());
   with.set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(sent.size()));
   with.set(CURLOPT_WRITEDATA, &reading);
   with.set(CURLOPT_HEADERDATA, &reading);
   const CURLcode result = curl_easy_perform(with.request);
-
   answer.bytesSent = sent.size();
-  if (result == CURLE_OK && !reading.headEnded) {
-    answer.error = "the head of the answer breaks off";
-    return answer;
-  }
-  // Of a failure the status is enough, however long its body.
   long status = 0;
   curl_easy_getinfo(with.request, CURLINFO_RESPONSE_CODE, &status);
-  if (result != CURLE_OK && !(reading.tooLong && status >= 300)) {
-    answer.error = with.reason[0] != '\0' ? with.reason : curl_easy_strerror(result);
+  // Of a failure the status is enough, however long its body.
+  const bool enough = reading.headEnded && reading.tooLong && status >= 300;
+  if ((result != CURLE_OK && !enough) || !reading.headEnded) {
+    curl_off_t uploaded = 0;
+    curl_easy_getinfo(with.request, CURLINFO_SIZE_UPLOAD_T, &uploaded);
+    answer.brokeWhileSending = uploaded > 0;
+    answer.error = with.watch.stalled()     ? "no byte has moved for too long"
+                   : with.reason[0] != '\0' ? with.reason
+                   : result == CURLE_OK     ? "the head of the answer breaks off"
+                                            : curl_easy_strerror(result);
     return answer;
   }
   answer.status = status;

@@ -22,6 +22,9 @@ struct CollectorAnswer {
   std::string error;                               // why no answer arrived, in words
   std::optional<std::chrono::seconds> retryAfter;  // the wait that the collector asks for, positive
   size_t bytesSent = 0;                            // of the request's body, after compression
+  // No answer arrived although some of the body had been sent. A smaller request may get through:
+  // the line may be slow, and some servers break the connection instead of answering 413.
+  bool brokeWhileSending = false;
 };
 
 class Collector {
@@ -41,20 +44,28 @@ class Collector {
 // Threads: one at a time, except for cancel(). REQUIRES: curl_global_init() was called.
 class CurlCollector final : public Collector {
  public:
+  // `settings` outlive the collector.
   CurlCollector(const ForwarderSettings& settings, std::string_view contentType);
   CurlCollector(const CurlCollector&) = delete;
   CurlCollector& operator=(const CurlCollector&) = delete;
   ~CurlCollector() override;
 
+  // Reads the files of the credentials anew if one has changed since the last request.
   CollectorAnswer post(std::string_view body) override;
+  // Whether the next request will do so.
+  bool hasNewCredentials() const;
   // Ends the present request and every later one without an answer. Any thread.
   void cancel() { cancelled_ = true; }
 
  private:
   struct Handles;
 
-  const bool compress_;
+  bool prepare();
+
+  const ForwarderSettings& settings_;
+  const std::string contentType_;
   std::atomic<bool> cancelled_{false};
+  std::string credentialsSeen_;
   std::unique_ptr<Handles> handles_;
 };
 

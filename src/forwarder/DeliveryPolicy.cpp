@@ -24,6 +24,8 @@ namespace {
 constexpr std::chrono::seconds kLongestAsked{3600};
 // Bytes of a collector's answer that we quote: enough for a sentence, short enough for a log line.
 constexpr size_t kMaxWords = 300;
+// Where a limit stays, one request in so many is sent in vain to find that out.
+constexpr uint32_t kMostPatience = 64;
 
 }  // namespace
 
@@ -42,14 +44,16 @@ Verdict verdictOn(const CollectorAnswer& answer, const Encoder& encoder) {
     case 504:
     case 507:
       return Verdict::later;
-    case 400:
-    case 413:
-    case 422:
     case 500:
       return Verdict::refused;
     default:
+      if (isAboutContent(answer)) return Verdict::refused;
       return answer.status > 511 ? Verdict::later : Verdict::hold;
   }
+}
+
+bool isAboutContent(const CollectorAnswer& answer) {
+  return answer.status == 400 || answer.status == kContentTooLarge || answer.status == 422;
 }
 
 std::string answerWords(const CollectorAnswer& answer) {
@@ -71,6 +75,23 @@ std::chrono::milliseconds Backoff::wait(uint32_t failures, double chance,
   const std::chrono::milliseconds wanted = std::min(*asked, kLongestAsked);
   const auto spread = static_cast<double>(std::max(first_, wanted / 2).count());
   return wanted + std::chrono::milliseconds{static_cast<int64_t>(chance * spread)};
+}
+
+void BatchSize::tooMuch(size_t bytes) {
+  // A record that is alone cannot be made smaller. It is sent however few bytes are left.
+  bytes_ = std::min(bytes_, std::max(bytes / 2, size_t{1}));
+  taken_ = 0;
+  // A larger size that failed at once would be tried again and again, so the next try waits twice
+  // as long as the last one: taken() has halved the patience before it.
+  patience_ = std::min(patience_ * 4, kMostPatience);
+}
+
+void BatchSize::taken(size_t bytes) {
+  // A request that had room left says nothing about a larger one.
+  if (bytes_ == most_ || bytes < bytes_ / 2 || ++taken_ < patience_) return;
+  bytes_ = std::min(most_, bytes_ * 2);
+  taken_ = 0;
+  patience_ = std::max(patience_ / 2, uint32_t{1});
 }
 
 std::chrono::nanoseconds Pace::waitAt(std::chrono::nanoseconds now) const {

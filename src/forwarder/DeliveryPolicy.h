@@ -22,6 +22,10 @@ enum class Verdict {
 
 // `encoder` made the request that is answered.
 Verdict verdictOn(const CollectorAnswer& answer, const Encoder& encoder);
+// Whether the status says that the content of the request is bad. A collector that is overloaded or
+// broken does not answer so.
+bool isAboutContent(const CollectorAnswer& answer);
+inline constexpr long kContentTooLarge = 413;
 
 // The status and the beginning of the body, or the error. One line that is fit for a terminal.
 std::string answerWords(const CollectorAnswer& answer);
@@ -45,6 +49,26 @@ class Backoff {
  private:
   const std::chrono::milliseconds first_;
   const std::chrono::milliseconds most_;
+};
+
+// How many bytes of records to put into a request. A collector may have a limit that nobody told
+// us, and a slow line may not carry a large request in time.
+class BatchSize {
+ public:
+  // Begins with `most` bytes, which is also the largest size.
+  explicit BatchSize(size_t most) : most_(most), bytes_(most) {}
+
+  size_t bytes() const { return bytes_; }
+  // A request with so many bytes of records was too large, or took too long.
+  void tooMuch(size_t bytes);
+  // A request with so many bytes was accepted.
+  void taken(size_t bytes);
+
+ private:
+  const size_t most_;
+  size_t bytes_;
+  uint32_t taken_ = 0;     // full requests since the last change
+  uint32_t patience_ = 1;  // so many before a larger one is tried
 };
 
 // Keeps to a number of records per second.

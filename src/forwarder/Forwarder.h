@@ -1,11 +1,13 @@
 // Forwarder: moves events from the spool to a collector, oldest first, each at least once.
 //
-//  - A batch that the collector takes is acknowledged in the spool.
-//  - A batch that it cannot take now is sent again after a while, for ever or a few times.
-//  - A batch that it refuses is split until the record at fault stands alone. That record is set
-//    aside with the collector's words, and the others are delivered.
-//  - An answer about the address or the credentials stops the delivery and sets nothing aside.
-//  - Many refused records in a row, with none taken between them, stop the delivery too.
+// It works in rounds. A round goes through all rows that wait, and ends early when the collector or
+// the spool fails. Between two rounds the caller waits for pause(). What must not be forgotten
+// between two rounds stands in the forwarder:
+//
+//  - The rows that the collector has taken and that the spool still holds, because its disk was
+//    full or somebody had locked it. Nothing else is sent before they are acknowledged.
+//  - Failures and held rounds in a row, and the size of a batch that the collector can take.
+//  - In how many rounds a row was refused.
 //
 // Threads: one at a time. Signalling the stop semaphore ends every wait early.
 
@@ -14,6 +16,8 @@
 #include <chrono>
 #include <cstdint>
 #include <functional>
+#include <map>
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -35,21 +39,22 @@ inline constexpr LogHandle kForwarderLog("com.vantor.TesselSupport", "statora_fo
 struct ForwarderOptions {
   size_t maxRecords = 512;            // in a batch
   size_t maxBytes = size_t{1} << 20;  // of a batch's records, unless one record alone has more
-  uint32_t maxAttempts = 0;           // to send one batch; 0: no limit
   std::chrono::milliseconds firstRetry{5000};
   std::chrono::milliseconds longestRetry{300'000};
-  uint32_t refusalsInARow = 16;     // so many mean that the collector itself is at fault
-  uint64_t recordsPerSecond = 100;  // 0: no limit
-  std::string destination;          // stands with the delivered rows; see ForwarderSettings
+  std::chrono::seconds interval{30};  // between two looks for new events
+  std::chrono::seconds hold{300};     // after an answer that holds everything
+  uint64_t recordsPerSecond = 100;    // 0: no limit
+  std::string destination;            // stands with the delivered rows; see ForwarderSettings
 };
 
-// How an attempt to deliver everything ended.
+// How a round ended.
 enum class ForwarderOutcome {
   delivered,    // nothing waits any more
   stopped,      // somebody asked it to stop
-  unreachable,  // gave up for now
-  held,         // the collector takes nothing, and a short wait would not help
+  unreachable,  // the collector does not answer, or cannot take anything now
+  held,         // the collector refuses everything or some rows, and a short wait would not help
   spoolFailed,  // the spool cannot be read or changed
+  lockedOut,    // another forwarder works on the spool
 };
 
 class Forwarder {
@@ -67,24 +72,51 @@ class Forwarder {
 
   Forwarder(World world, const ForwarderOptions& options);
 
-  // Delivers until nothing waits. REQUIRES: the state is open.
+  // One round. Opens the spool if it is not open, and does nothing if there is none.
   ForwarderOutcome deliverAll();
-  // Why the last outcome was not `delivered`, in words.
+  // How long to wait after the last round.
+  std::chrono::nanoseconds pause() const { return pause_; }
+  // Why the last outcome was not `delivered`, in words. Empty after `delivered` and `stopped`.
   const std::string& reason() const { return reason_; }
+  // Whether the spool still holds rows that the collector has taken.
+  bool owesAcknowledgement() const { return !taken_.empty(); }
+  // Tries to acknowledge those. True if it owes nothing any more.
+  bool acknowledgeTaken();
 
  private:
   using Records = std::span<const OutgoingRecord>;
   enum class Sent { accepted, refused, failed };
+  // Records that still have to be sent, and the number of accepted requests when one with these
+  // records was refused first.
+  struct Part {
+    Records records;
+    uint64_t acceptedBefore;
+  };
+  // A record that was refused alone. Once another one was accepted, it is asked about again.
+  struct Suspect {
+    OutgoingRecord record;
+    uint64_t acceptedBefore;
+  };
 
-  ForwarderOutcome deliverBatch(const Batch& batch);
-  // After `failed`, `outcome_` and `reason_` say what has failed.
+  bool open();
+  bool deliverRows();
+  bool deliverBatch(const Batch& batch);
+  bool setMalformedAside(const Batch& batch);
+  // After `failed`, `outcome_` and `reason_` say what has failed. Otherwise `answer_` and
+  // `verdict_` are those of the request.
   Sent send(Records part);
-  void noteFailure(const CollectorAnswer& answer);
-  bool waitToRetry(const CollectorAnswer& answer, uint32_t failures);
-  Sent settle(Records part, const CollectorAnswer& answer);
+  bool acknowledge(Records part, uint64_t rejected);
+  bool mayGoOn(std::vector<Part>& parts, int64_t lastId);
+  bool isAnotherAccepted(std::vector<Part>& parts, int64_t lastId);
+  bool askAboutSuspects();
+  bool askAgain(const Suspect& suspect);
   bool setAside(const SpooledEvent& event, int64_t status, const std::string& words);
+  bool leaveBehind(const std::string& words);
   bool takeBreak(std::chrono::nanoseconds time);
-  Sent fail(ForwarderOutcome outcome, std::string reason);
+  bool fail(ForwarderOutcome outcome, std::string reason);
+  bool failBySpool(const SqliteStatus& status);
+  bool failByAnswer();
+  void endRound();
   uint64_t settled() const;
   void sayProgress();
   std::chrono::nanoseconds ticks();
@@ -93,9 +125,32 @@ class Forwarder {
   const ForwarderOptions options_;
   const Backoff backoff_;
   Pace pace_;
-  uint32_t refusals_ = 0;  // records set aside since one was accepted
+  BatchSize size_;
+  std::chrono::nanoseconds pause_{0};
+
+  // What is remembered from round to round.
+  std::vector<SpooledEvent> taken_;  // accepted by the collector, and still in the spool
+  uint64_t takenRejected_ = 0;       // how many of them the collector threw away
+  uint64_t generation_ = 0;          // of the spool, see ForwarderState::generation()
+  bool provedWritable_ = false;      // by as much as an acknowledgement writes
+  uint32_t failures_ = 0;            // rounds in a row that ended as `unreachable`
+  uint32_t heldRounds_ = 0;          // rounds since everything was delivered that ended as `held`
+  uint32_t spoolFailures_ = 0;       // rounds in a row that ended as `spoolFailed`
+  std::map<int64_t, uint32_t> refusedRounds_;  // by row: in how many rounds it alone was refused
+  uint64_t accepted_ = 0;                      // requests
+
+  // What belongs to the present round.
   ForwarderOutcome outcome_ = ForwarderOutcome::delivered;
   std::string reason_;
+  bool probing_ = false;  // whether each answer may be about a record; see mayGoOn()
+  CollectorAnswer answer_;
+  Verdict verdict_ = Verdict::accepted;
+  uint64_t acceptedBeforeRound_ = 0;
+  uint32_t refusedInARow_ = 0;  // records refused alone since one was accepted
+  uint64_t scouted_ = 0;        // rows sent out of order
+  std::vector<Suspect> suspects_;
+  size_t leftBehind_ = 0;  // rows that were refused and still wait
+  std::string leftBehindWords_;
 };
 
 }  // namespace tessel

@@ -7,6 +7,7 @@
 
 #include <arpa/inet.h>
 #include <curl/curl.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <charconv>
@@ -156,16 +157,12 @@ bool isLoopback(const std::string& host) {
   return inet_pton(AF_INET, host.c_str(), &address) == 1 && (ntohl(address.s_addr) >> 24) == 127;
 }
 
-// Scheme, host and port of the URL `text`, if events may be sent there. Plain http shows events and
-// credentials to the network. So it needs the operator's consent, unless the request stays on this
-// machine.
-std::optional<std::string> acceptedDestination(const std::string& text, bool allowHttp) {
-  const CurlUrl url(curl_url(), &curl_url_cleanup);
-  if (curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return {};
-  const std::string scheme = urlPart(url.get(), CURLUPART_SCHEME);
-  const std::string host = urlPart(url.get(), CURLUPART_HOST);
-  if (scheme != "https" && !(scheme == "http" && (allowHttp || isLoopback(host)))) return {};
-  const std::string port = urlPart(url.get(), CURLUPART_PORT);
+// Scheme, host and port, or nothing if the text is no URL.
+std::string destinationOf(CURLU* url) {
+  const std::string scheme = urlPart(url, CURLUPART_SCHEME);
+  const std::string host = urlPart(url, CURLUPART_HOST);
+  const std::string port = urlPart(url, CURLUPART_PORT);
+  if (scheme.empty() || host.empty()) return {};
   return scheme + "://" + host + (port.empty() ? "" : ":" + port);
 }
 
@@ -195,6 +192,17 @@ const OutputFormat* readOutput(Variables& variables) {
                 [&](const OutputFormat& format) { return format.format == first->format; });
 }
 
+// OpenTelemetry's rule: the address for all signals gets the path of this signal appended, and the
+// address for logs is complete as it is. A query stays behind the path.
+void appendPath(CURLU* url, std::string_view path) {
+  std::string whole = urlPart(url, CURLUPART_PATH);
+  while (whole.ends_with('/')) whole.pop_back();
+  whole.append(path);
+  curl_url_set(url, CURLUPART_PATH, whole.c_str(), 0);
+}
+
+// Plain http shows events and credentials to the network. So it needs the operator's consent,
+// unless the request stays on this machine.
 void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   const bool allowHttp = variables.flag("TESSEL_FORWARD_ALLOW_HTTP");
   const auto endpoint = variables.standard("ENDPOINT");
@@ -202,28 +210,22 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
     variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
     return;
   }
-  // OpenTelemetry's rule: the address for all signals gets the path of this signal appended, and
-  // the address for logs is complete as it is. A format that is not OTLP has no such path.
-  settings.url = endpoint->value;
-  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT" && !settings.output->path.empty()) {
-    while (settings.url.ends_with('/')) settings.url.pop_back();
-    settings.url += settings.output->path;
-  }
-  const auto destination = acceptedDestination(settings.url, allowHttp);
-  if (!destination) {
+  const CurlUrl url(curl_url(), &curl_url_cleanup);
+  const bool valid =
+      curl_url_set(url.get(), CURLUPART_URL, endpoint->value.c_str(), 0) == CURLUE_OK;
+  settings.loopback = isLoopback(urlPart(url.get(), CURLUPART_HOST));
+  settings.destination = destinationOf(url.get());
+  const std::string scheme = urlPart(url.get(), CURLUPART_SCHEME);
+  if (!valid || (scheme != "https" && !(scheme == "http" && (allowHttp || settings.loopback)))) {
+    // The whole text may hold a password, even where it is no URL.
     variables.complain(
-        endpoint->name, endpoint->value,
+        endpoint->name, settings.destination.empty() ? "(not shown: no URL)" : settings.destination,
         "an https URL, or an http one to loopback (to any host with TESSEL_FORWARD_ALLOW_HTTP=1)");
+    return;
   }
-  settings.destination = destination.value_or("");
-}
-
-// The error names the source of the headers and never shows them.
-void addHeaders(Variables& variables, ForwarderSettings& settings, const std::string& source,
-                std::string_view text) {
-  const auto headers = parseHeaders(text);
-  if (!headers) return variables.complain(source, "(not shown)", kMembersForm);
-  settings.headers.insert(settings.headers.end(), headers->begin(), headers->end());
+  if (endpoint->name == "OTEL_EXPORTER_OTLP_ENDPOINT" && !settings.output->path.empty())
+    appendPath(url.get(), settings.output->path);
+  settings.url = urlPart(url.get(), CURLUPART_URL);
 }
 
 void readEncoding(Variables& variables, EncodingSettings& settings) {
@@ -241,31 +243,46 @@ void readEncoding(Variables& variables, EncodingSettings& settings) {
   settings.resourceAttributes = std::move(*members);
 }
 
+std::string headersFile(const ForwarderSettings& settings) {
+  return settings.credentials + "/otlp-headers";
+}
+
 // The service manager makes $CREDENTIALS_DIRECTORY. Only this service can read its files, and they
 // are gone when the service ends.
-void readCredentials(Variables& variables, ForwarderSettings& settings) {
-  const auto directory = variables.value("CREDENTIALS_DIRECTORY");
-  if (!directory) return;
-  if (const auto text = readSmallFile(*directory + "/otlp-headers", kMaxCredentialBytes)) {
-    addHeaders(variables, settings, "otlp-headers in CREDENTIALS_DIRECTORY", trimmed(*text));
-  }
-  // A path in a variable wins over the credential.
-  const auto useFile = [&](std::string& target, const char* name) {
-    std::error_code ignored;
-    const std::string path = *directory + "/" + name;
-    if (target.empty() && std::filesystem::exists(path, ignored)) target = path;
-  };
-  useFile(settings.authorities, "otlp-certificate");
-  useFile(settings.clientCertificate, "otlp-client-certificate");
-  useFile(settings.clientKey, "otlp-client-key");
+void readCredentialsDirectory(Variables& variables, ForwarderSettings& settings) {
+  settings.credentials = variables.value("CREDENTIALS_DIRECTORY").value_or("");
+  if (!readCredentials(settings))
+    variables.complain("otlp-headers in CREDENTIALS_DIRECTORY", "(not shown)", kMembersForm);
+}
+
+// The path of a variable, or else of a credential that exists.
+std::string pathOf(const ForwarderSettings& settings, const std::string& variable,
+                   const char* name) {
+  if (!variable.empty() || settings.credentials.empty()) return variable;
+  std::error_code ignored;
+  const std::string path = settings.credentials + "/" + name;
+  return std::filesystem::exists(path, ignored) ? path : "";
+}
+
+std::string nameOf(std::string_view header) {
+  std::string name(header.substr(0, header.find(':')));
+  std::transform(name.begin(), name.end(), name.begin(), [](char letter) {
+    return letter >= 'A' && letter <= 'Z' ? static_cast<char>(letter - 'A' + 'a') : letter;
+  });
+  return name;
 }
 
 void readTransport(Variables& variables, ForwarderSettings& settings) {
   if (const auto headers = variables.standard("HEADERS")) {
-    addHeaders(variables, settings, headers->name, headers->value);
+    const auto parsed = parseHeaders(headers->value);
+    if (!parsed) variables.complain(headers->name, "(not shown)", kMembersForm);
+    settings.headers = parsed.value_or(Headers{});
   }
+  // The standard's limit is for the whole request. Whoever sets it may want to wait for longer than
+  // we would without a byte.
   if (const auto timeout = variables.standard("TIMEOUT")) {
     settings.timeout = std::chrono::milliseconds{variables.number(timeout->name, 1).value_or(1)};
+    settings.stall = std::chrono::milliseconds{0};
   }
   if (const auto compression = variables.standard("COMPRESSION")) {
     settings.compress = compression->value == "gzip";
@@ -288,19 +305,69 @@ std::variant<ForwarderSettings, LaunchError> readForwarderSettings(
   readEncoding(variables, settings);
   readEndpoint(variables, settings);
   readTransport(variables, settings);
-  readCredentials(variables, settings);
+  readCredentialsDirectory(variables, settings);
   const auto seconds = [&variables](const char* name, auto& target, int64_t least) {
     if (const auto value = variables.number(name, least)) target = std::chrono::seconds{*value};
   };
   seconds("TESSEL_FORWARD_SPREAD", settings.spread, 0);
   seconds("TESSEL_FORWARD_INTERVAL", settings.interval, 1);
   seconds("TESSEL_FORWARD_RETRY", settings.retry, 1);
+  seconds("TESSEL_FORWARD_HOLD", settings.hold, 1);
   if (const auto rate = variables.number("TESSEL_FORWARD_RATE", 0)) {
     settings.recordsPerSecond = static_cast<uint64_t>(*rate);
   }
   settings.sendHealth = variables.flag("TESSEL_FORWARD_HEALTH");
   if (variables.error()) return *variables.error();
   return settings;
+}
+
+std::optional<Credentials> readCredentials(const ForwarderSettings& settings) {
+  Credentials read{settings.headers, pathOf(settings, settings.authorities, "otlp-certificate"),
+                   pathOf(settings, settings.clientCertificate, "otlp-client-certificate"),
+                   pathOf(settings, settings.clientKey, "otlp-client-key")};
+  if (settings.credentials.empty()) return read;
+  const auto text = readSmallFile(headersFile(settings), kMaxCredentialBytes);
+  const auto headers = parseHeaders(trimmed(text.value_or("")));
+  if (!headers) return {};
+  read.headers.insert(read.headers.end(), headers->begin(), headers->end());
+  return read;
+}
+
+std::string credentialsMark(const ForwarderSettings& settings) {
+  std::string mark;
+  for (const std::string& path :
+       {headersFile(settings), pathOf(settings, settings.authorities, "otlp-certificate"),
+        pathOf(settings, settings.clientCertificate, "otlp-client-certificate"),
+        pathOf(settings, settings.clientKey, "otlp-client-key")}) {
+    struct stat facts {};
+    // The number of the file changes when a new one takes its place within one tick of the clock.
+    if (::stat(path.c_str(), &facts) == 0)
+      mark += std::to_string(facts.st_ino) + ' ' + std::to_string(facts.st_size) + ' ' +
+              std::to_string(facts.st_mtim.tv_sec) + ' ' + std::to_string(facts.st_mtim.tv_nsec);
+    mark += ';';
+  }
+  return mark;
+}
+
+std::vector<std::string> requestHeaders(const ForwarderSettings& settings,
+                                        const Credentials& credentials,
+                                        std::string_view contentType) {
+  // Without "Expect:" libcurl would ask before each large body whether it may send it, and wait.
+  std::vector<std::string> all{"Content-Type: " + std::string(contentType), "Expect:"};
+  if (settings.compress) all.emplace_back("Content-Encoding: gzip");
+  for (const std::string& header : credentials.headers) {
+    const std::string name = nameOf(header);
+    // These tell how our body is made, so nobody else can know better. Only a format that goes to
+    // servers of every kind may need another type than ours.
+    const bool ours = name == "content-encoding" || name == "content-length" ||
+                      name == "transfer-encoding" || name == "expect" ||
+                      (name == "content-type" && !settings.output->protocol.empty());
+    if (ours) continue;
+    // The file comes after the variables, and it is what operators renew.
+    std::erase_if(all, [&](const std::string& earlier) { return nameOf(earlier) == name; });
+    all.push_back(header);
+  }
+  return all;
 }
 
 std::variant<EncodingSettings, LaunchError> readEncodingSettings(

@@ -52,7 +52,9 @@ class HealthTest : public ::testing::Test {
       taken.push_back(&row);
       if (row.name == kHealthEvent) records.push_back(Json::parse(row.payload));
     }
-    EXPECT_TRUE(rows.empty() || state_.acknowledge(taken, 0, "here", now_).ok());
+    ForwarderState::Rows left = taken;
+    uint64_t rejected = 0;
+    EXPECT_TRUE(rows.empty() || state_.acknowledge(left, rejected, "here", now_).ok());
     return records;
   }
   Json delivered() {

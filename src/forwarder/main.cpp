@@ -21,6 +21,7 @@
 #include "linux/ServiceRuntime.h"
 #include "linux/SystemFacts.h"
 #include "platform/Queues.h"
+#include "statora/ForwarderLock.h"
 
 namespace tessel {
 namespace {
@@ -51,21 +52,34 @@ int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
   }
   for (int64_t after = 0;;) {
     std::vector<SpooledEvent> events = state.oldest(options.maxRecords, options.maxBytes, after);
-    if (events.empty()) return state.status().ok() ? 0 : EX_IOERR;
+    if (events.empty()) break;
     const Batch batch = cutBatch(std::move(events), encoder, state.spoolId(), options.maxBytes);
     after = batch.lastId;
-    if (!batch.records.empty()) std::cout << encoder.body(batch.records);
+    if (!batch.records.empty()) std::cout << encoder.body(batch.records) << std::flush;
+    // A disk without room, or a reader that has gone.
+    if (!std::cout) break;
   }
+  if (state.status().ok() && std::cout) return 0;
+  std::cerr << (std::cout ? state.status().reason : "The output cannot be written") << '\n';
+  return EX_IOERR;
 }
 
-// It can run beside a forwarder, because the rows move in one transaction.
+// Both of the following are short and change nothing halfway, so signals may end them at once.
+void letSignalsEndUs() {
+  sigset_t signals;
+  sigemptyset(&signals);
+  for (const int signalNumber : {SIGTERM, SIGINT}) sigaddset(&signals, signalNumber);
+  pthread_sigmask(SIG_UNBLOCK, &signals, nullptr);
+}
+
+// It takes the lock of forwarders: a forwarder at work would not count these rows.
 int requeue(const std::string& stateDirectory) {
   ForwarderState state(stateDirectory);
   SqliteStatus status = state.open();
   const auto rows = status.ok() ? state.requeue() : std::nullopt;
   if (!rows) {
     std::cerr << "Nothing was put back: " << (status.ok() ? state.status() : status).reason << '\n';
-    return EX_IOERR;
+    return status.code == kHeldByAnotherForwarder ? EX_TEMPFAIL : EX_IOERR;
   }
   std::cout << *rows << " events wait again\n";
   return 0;
@@ -94,6 +108,7 @@ int exitStatus(ForwarderOutcome outcome) {
     case ForwarderOutcome::stopped:
       return 0;
     case ForwarderOutcome::unreachable:
+    case ForwarderOutcome::lockedOut:
       return EX_TEMPFAIL;
     case ForwarderOutcome::held:
       return EX_UNAVAILABLE;
@@ -115,38 +130,26 @@ class Complaints {
   std::string last_;
 };
 
-std::string complaint(ForwarderOutcome outcome, const std::string& reason) {
-  switch (outcome) {
-    case ForwarderOutcome::delivered:
-    case ForwarderOutcome::stopped:
-      return {};
-    case ForwarderOutcome::unreachable:
-      return "The collector cannot be reached: " + reason;
-    case ForwarderOutcome::held:
-      return "The collector takes nothing: " + reason;
-    case ForwarderOutcome::spoolFailed:
-      return "The spool cannot be used: " + reason;
-  }
-  return {};
-}
-
 class Service {
  public:
   Service(const LaunchConfiguration& launch, const ForwarderSettings& settings,
-          const Encoder& encoder, Semaphore& stop, Collector& collector)
+          const Encoder& encoder, Semaphore& stop, CurlCollector& collector)
       : settings_(settings),
         stop_(stop),
         state_(launch.stateDirectory),
         health_(launch.stateDirectory, state_),
         manager_(connectServiceManager(clock_)),
-        encoder_(encoder),
-        collector_(collector) {}
+        collector_(collector),
+        forwarder_({state_, encoder, collector, clock_, *manager_, stop, chance},
+                   optionsFor(settings)) {}
 
   int runOnce() {
-    if (!state_.exists()) return 0;  // the service has never sent anything
-    ForwarderOptions options = optionsFor(settings_);
-    options.maxAttempts = kAttemptsAtOnce;
-    return exitStatus(attempt(options));
+    ForwarderOutcome outcome = round();
+    for (uint32_t rounds = 1; rounds < kRoundsAtOnce && mayHelpToWait(outcome); ++rounds) {
+      outcome = clock_.wait(stop_, forwarder_.pause()) ? ForwarderOutcome::stopped : round();
+    }
+    end();
+    return exitStatus(outcome);
   }
 
   int runForEver() {
@@ -156,49 +159,63 @@ class Service {
     const std::chrono::duration<double> turn = settings_.spread * chance();
     bool stopped = clock_.wait(stop_, std::chrono::duration_cast<std::chrono::nanoseconds>(turn));
     while (!stopped) {
-      const ForwarderOutcome outcome =
-          state_.exists() ? attempt(optionsFor(settings_)) : ForwarderOutcome::delivered;
-      stopped = outcome == ForwarderOutcome::stopped ||
-                clock_.wait(stop_, outcome == ForwarderOutcome::held ? kHold : settings_.interval);
+      const ForwarderOutcome outcome = round();
+      stopped = outcome == ForwarderOutcome::stopped || pause(outcome);
     }
     manager_->stopping();
+    end();
     return 0;
   }
 
  private:
   // With --once, something else starts the next attempt. By default eight attempts take five to ten
   // minutes with their waits.
-  static constexpr uint32_t kAttemptsAtOnce = 8;
-  // An operator has to correct an address or a password, which takes longer than a retry.
-  static constexpr std::chrono::seconds kHold{300};
+  static constexpr uint32_t kRoundsAtOnce = 8;
 
   static ForwarderOptions optionsFor(const ForwarderSettings& settings) {
     ForwarderOptions options;
     options.firstRetry = settings.retry;
+    options.interval = settings.interval;
+    options.hold = settings.hold;
     options.recordsPerSecond = settings.recordsPerSecond;
     options.destination = settings.destination;
     return options;
   }
 
-  ForwarderOutcome attempt(const ForwarderOptions& options) {
-    std::string words;
-    ForwarderOutcome outcome = ForwarderOutcome::spoolFailed;
-    if (const SqliteStatus opened = state_.open(); opened.ok()) {
-      Forwarder forwarder({state_, encoder_, collector_, clock_, *manager_, stop_, chance},
-                          options);
-      // A record of a time when health was still wanted must not leave.
-      if (!settings_.sendHealth) health_.withdraw();
-      outcome = forwarder.deliverAll();
-      // After the rows, so that the record tells what became of them.
-      const bool added = settings_.sendHealth && health_.look(clock_.now());
-      if (added && outcome == ForwarderOutcome::delivered) outcome = forwarder.deliverAll();
-      words = complaint(outcome, forwarder.reason());
-    } else {
-      words = complaint(outcome, opened.reason);
-    }
+  bool mayHelpToWait(ForwarderOutcome outcome) const {
+    return outcome == ForwarderOutcome::unreachable || forwarder_.owesAcknowledgement();
+  }
+
+  ForwarderOutcome round() {
+    // A record of a time when health was still wanted must not leave.
+    if (!settings_.sendHealth && isSpoolOpen()) health_.withdraw();
+    ForwarderOutcome outcome = forwarder_.deliverAll();
+    // After the rows, so that the record tells what became of them.
+    const bool added = settings_.sendHealth && isSpoolOpen() && health_.look(clock_.now());
+    if (added && outcome == ForwarderOutcome::delivered) outcome = forwarder_.deliverAll();
+    const std::string& words = forwarder_.reason();
     complaints_.tell(words);
     manager_->say(words.empty() ? "Delivered what there was" : words);
     return outcome;
+  }
+
+  bool isSpoolOpen() { return state_.exists() && state_.open().ok(); }
+
+  // Waits for the next round. A renewed credential ends a hold early. True if somebody asked to
+  // stop.
+  bool pause(ForwarderOutcome outcome) {
+    std::chrono::nanoseconds left = forwarder_.pause();
+    while (outcome == ForwarderOutcome::held && left > settings_.interval) {
+      if (clock_.wait(stop_, settings_.interval)) return true;
+      if (collector_.hasNewCredentials()) return false;
+      left -= settings_.interval;
+    }
+    return clock_.wait(stop_, left);
+  }
+
+  // What the collector has taken and the spool still holds would be sent again by the next start.
+  void end() {
+    if (!forwarder_.acknowledgeTaken()) complaints_.tell(forwarder_.reason());
   }
 
   const ForwarderSettings& settings_;
@@ -207,8 +224,8 @@ class Service {
   ForwarderState state_;
   Health health_;
   std::unique_ptr<ServiceManager> manager_;
-  const Encoder& encoder_;
-  Collector& collector_;
+  CurlCollector& collector_;
+  Forwarder forwarder_;
   Complaints complaints_;
 };
 
@@ -239,6 +256,7 @@ int run(const Arguments& arguments) {
   setLogSink(sink, configuration.logLevel);
   // Neither --requeue nor --dry-run needs a collector, so the settings of one are not read for
   // them.
+  if (arguments.requeue || !arguments.dryRun.empty()) letSignalsEndUs();
   if (arguments.requeue) return requeue(configuration.stateDirectory);
   if (!arguments.dryRun.empty()) {
     const auto encoding = readEncodingSettings(environment);

@@ -104,6 +104,26 @@ TEST(PolicyTest, WaitsDoubleAndHalfIsChance) {
     EXPECT_EQ(backoff.wait(c.failures, c.chance, c.asked), c.wait) << c.failures;
 }
 
+TEST(PolicyTest, ABatchIsAsLargeAsTheCollectorTakes) {
+  BatchSize size(1024);
+  size.taken(1024);
+  EXPECT_EQ(size.bytes(), 1024u);
+  size.tooMuch(1000);
+  EXPECT_EQ(size.bytes(), 500u);
+  size.tooMuch(1);
+  EXPECT_EQ(size.bytes(), 1u);
+  // A limit of 300: few requests are too large, and the size is near the limit.
+  int refused = 0;
+  for (int request = 0; request < 1000; ++request) {
+    size.bytes() > 300 ? (++refused, size.tooMuch(size.bytes())) : size.taken(size.bytes());
+  }
+  EXPECT_LT(refused, 30);
+  EXPECT_GE(size.bytes(), 128u);
+  // The limit is lifted.
+  for (int request = 0; request < 200; ++request) size.taken(size.bytes());
+  EXPECT_EQ(size.bytes(), 1024u);
+}
+
 TEST(PolicyTest, PaceSpreadsRecordsOverTime) {
   Pace pace(100);
   EXPECT_EQ(pace.waitAt(seconds{1000}), nanoseconds{0});

@@ -24,6 +24,7 @@
 #include <utility>
 
 #include "platform/Invariant.h"
+#include "statora/ForwarderLock.h"
 #include "statora/Spool.h"
 
 namespace tessel {
@@ -44,17 +45,17 @@ constexpr uint64_t kBytesMovedAtOnce = uint64_t{96} << 10;
 // The forwarder does so much earlier, to spare the service the work.
 constexpr int64_t kForwardersCheckpointPages = 500;
 
+// Pages that an acknowledgement of a batch writes: of the rows that leave `events`, and of the
+// copies.
+constexpr int64_t kPagesOfAcknowledgement = 128;
+
+// While a reader holds the log, each delivery makes it longer, and nobody can shorten it. Copies
+// stop at twice its usual length. At three times we send nothing until the reader has ended.
+constexpr int64_t kHeldLogOfCopies = 2;
+constexpr int64_t kHeldLog = 3;
+
 // Rows that a look for expired rows reads. A look comes every 30 seconds and must cost nothing.
 constexpr int64_t kRowsLookedAt = 32;
-
-// A newer service may only have added to the spool. It then says in `compatible_from` the oldest
-// version that still finds its way. Without that word a newer spool may mean anything, and sending
-// rows that we do not understand cannot be taken back.
-bool isUnderstood(SqliteDatabase& database, int64_t version) {
-  if (version <= kSpoolSchemaVersion) return version == kSpoolSchemaVersion;
-  const auto oldest = database.integer("SELECT value FROM meta WHERE key='compatible_from'");
-  return oldest && *oldest >= 1 && *oldest <= kSpoolSchemaVersion;
-}
 
 constexpr char kTables[] =
     "BEGIN IMMEDIATE;"
@@ -65,45 +66,12 @@ constexpr char kTables[] =
     " words TEXT NOT NULL);"
     "COMMIT";
 
-struct Counter {
-  const char* name;
-  uint64_t ForwarderCounters::*value;
-};
-constexpr Counter kCounters[] = {
-    {"delivered", &ForwarderCounters::delivered},
-    {"rejected", &ForwarderCounters::rejected},
-    {"set_aside", &ForwarderCounters::setAside},
-    {"set_aside_dropped", &ForwarderCounters::setAsideDropped},
-    {"requests", &ForwarderCounters::requests},
-    {"retries", &ForwarderCounters::retries},
-    {"bytes_sent", &ForwarderCounters::bytesSent},
-    {"position", &ForwarderCounters::position},
-    {"last_success", &ForwarderCounters::lastSuccess},
-    {"last_error_at", &ForwarderCounters::lastErrorAt},
-    {"ordered_until", &ForwarderCounters::orderedUntil},
-};
-// Stands in the same table, because a column of SQLite takes a text as well as a number.
-constexpr std::string_view kLastError = "last_error";
-
 }  // namespace
 
-std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database) {
-  SqliteStatement select = database.prepare("SELECT name, value FROM forwarder");
-  if (!select.prepared()) return {};
-  ForwarderCounters counters;
-  while (select.step() == SqliteStatement::Step::row) {
-    const auto* const known =
-        std::find_if(std::begin(kCounters), std::end(kCounters),
-                     [&](const Counter& counter) { return select.text(0) == counter.name; });
-    if (known != std::end(kCounters))
-      counters.*known->value = static_cast<uint64_t>(select.integer(1));
-    if (select.text(0) == kLastError) counters.lastError = select.text(1);
-  }
-  return counters;
-}
-
 ForwarderState::ForwarderState(std::string stateDirectory, uint64_t maxSetAside)
-    : path_(std::move(stateDirectory) + "/" + kSpoolFileName), maxSetAside_(maxSetAside) {}
+    : directory_(std::move(stateDirectory)),
+      path_(directory_ + "/" + kSpoolFileName),
+      maxSetAside_(maxSetAside) {}
 
 bool ForwarderState::exists() const {
   struct stat facts {};
@@ -113,10 +81,20 @@ bool ForwarderState::exists() const {
 SqliteStatus ForwarderState::open() {
   // The service renames a damaged spool and begins a new one under the old name.
   if (database_.isOpen() && isStillThere()) return {};
-  SqliteStatus status = openAndPrepare();
+  SqliteStatus status = lock();
+  if (status.ok()) status = openAndPrepare();
   // abandon() and not close(): a checkpoint would write into a spool that we cannot use.
   if (!status.ok()) database_.abandon();
   return status;
+}
+
+// Two forwarders would send every row twice and count it twice.
+SqliteStatus ForwarderState::lock() {
+  if (lock_.valid()) return {};
+  auto taken = takeForwarderLock(directory_);
+  if (auto* refused = std::get_if<SqliteStatus>(&taken)) return std::move(*refused);
+  lock_ = std::move(std::get<UniqueFd>(taken));
+  return {};
 }
 
 SqliteStatus ForwarderState::openAndPrepare() {
@@ -153,9 +131,9 @@ bool ForwarderState::isStillThere() const {
 
 SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   delivered_.close();
-  for (SqliteStatement* statement :
-       {&select_, &remove_, &keep_, &trim_, &count_, &pageCount_, &freePages_})
+  for (SqliteStatement* statement : {&select_, &remove_, &keep_, &count_, &pageCount_, &freePages_})
     *statement = {};
+  ++generation_;
   // close() would empty and delete the log by its name, and that may by now be the new spool's log.
   database_.abandon();
   struct stat facts {};
@@ -168,7 +146,7 @@ SqliteStatus ForwarderState::openFresh(SqliteDatabase::Mode mode) {
   database_.setBusyTimeout(kForwardersPatience);
   const auto version = database_.integer("PRAGMA user_version");
   if (!version) return database_.status();
-  if (!isUnderstood(database_, *version)) {
+  if (!isUnderstoodSpool(database_, *version)) {
     return {SQLITE_SCHEMA,
             "the spool was made by another version (schema " + std::to_string(*version) + ")"};
   }
@@ -185,14 +163,14 @@ SqliteStatus ForwarderState::prepareStatements() {
   };
   const bool good =
       prepare(select_, kSelectEvents) && prepare(remove_, "DELETE FROM events WHERE id=?1") &&
+      // A row that was put back into another spool may have the id of one that stands here already.
+      // Both stay: without an id SQLite chooses a free one.
       prepare(keep_,
-              "INSERT OR REPLACE INTO forwarder_set_aside VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7)") &&
-      prepare(
-          trim_,
-          "DELETE FROM forwarder_set_aside WHERE id IN"
-          " (SELECT id FROM forwarder_set_aside ORDER BY at DESC, id DESC LIMIT -1 OFFSET ?1)") &&
+              "INSERT INTO forwarder_set_aside SELECT"
+              " CASE WHEN EXISTS (SELECT 1 FROM forwarder_set_aside WHERE id=?1) THEN NULL"
+              " ELSE ?1 END, ?2, ?3, ?4, ?5, ?6, ?7") &&
       prepare(pageCount_, "PRAGMA page_count") && prepare(freePages_, "PRAGMA freelist_count") &&
-      prepare(count_, "INSERT OR REPLACE INTO forwarder VALUES(?1, ?2)");
+      prepare(count_, kInsertCounter);
   return good ? SqliteStatus{} : database_.status();
 }
 
@@ -200,23 +178,18 @@ std::vector<SpooledEvent> ForwarderState::oldest(size_t maxRows, size_t maxBytes
   return readEvents(select_, after, maxRows, maxBytes);
 }
 
-uint64_t ForwarderState::waiting() {
-  return static_cast<uint64_t>(
-      database_
-          .integer(
-              "SELECT coalesce((SELECT max(id) FROM events) - (SELECT min(id) FROM events) + 1, 0)")
-          .value_or(0));
+std::vector<SpooledEvent> ForwarderState::someEvent(int64_t after, double chance) {
+  const int64_t last = database_.integer("SELECT max(id) FROM events").value_or(after);
+  if (last <= after) return {};
+  // At most last - 1, so that there is a row above it.
+  const auto beyond = static_cast<int64_t>(chance * static_cast<double>(last - after));
+  return oldest(1, 1, std::min(after + beyond, last - 1));
 }
 
-bool ForwarderState::writeCounters() {
-  if (!counters_.lastError.empty() &&
-      !count_.bind(1, kLastError).bind(2, counters_.lastError).run())
-    return false;
-  return std::all_of(std::begin(kCounters), std::end(kCounters), [this](const Counter& counter) {
-    return count_.bind(1, std::string_view(counter.name))
-        .bind(2, static_cast<int64_t>(counters_.*counter.value))
-        .run();
-  });
+uint64_t ForwarderState::waiting() {
+  const auto span = database_.integer(
+      "SELECT coalesce((SELECT max(id) FROM events) - (SELECT min(id) FROM events) + 1, 0)");
+  return static_cast<uint64_t>(std::max<int64_t>(span.value_or(0), 0));
 }
 
 // Ends a transaction: commits it if all went well, and takes all of it back otherwise.
@@ -242,16 +215,34 @@ int ForwarderState::afterCommit(void* self, sqlite3* handle, const char* schema,
   return SQLITE_OK;
 }
 
-// Whether a reader keeps the log from beginning anew. The checkpoint tells: it succeeds if the next
-// commit begins the log anew.
-bool ForwarderState::logIsHeld() {
-  if (logPages_ <= 2 * checkpointPages_) return false;
+// Whether the log has more than `pages` pages because a reader keeps it from beginning anew. The
+// checkpoint tells: it succeeds if the next commit begins the log anew.
+bool ForwarderState::logIsHeld(int64_t pages) {
+  if (logPages_ <= pages) return false;
   database_.setBusyTimeout(0);
   const int code = sqlite3_wal_checkpoint_v2(database_.handle(), nullptr, SQLITE_CHECKPOINT_RESTART,
                                              nullptr, nullptr);
   database_.setBusyTimeout(kForwardersPatience);
   if (code == SQLITE_OK) logPages_ = 0;
   return code != SQLITE_OK;
+}
+
+SqliteStatus ForwarderState::proveWritable(bool asMuchAsABatch) {
+  if (asMuchAsABatch) {
+    // A full disk often has room for a page or two. So this writes about what an acknowledgement
+    // writes, and gives the pages back.
+    const std::string bytes =
+        std::to_string(kSpoolPageBytes * std::min(kPagesOfAcknowledgement, checkpointPages_));
+    SqliteStatus written =
+        database_.execute("INSERT OR REPLACE INTO forwarder VALUES('proof', zeroblob(" + bytes +
+                          "));"
+                          "DELETE FROM forwarder WHERE name='proof'");
+    if (!written.ok()) return written;
+  }
+  if (SqliteStatus stored = storeCounters(); !stored.ok()) return stored;
+  if (logIsHeld(kHeldLog * checkpointPages_))
+    return {SQLITE_BUSY_SNAPSHOT, "a reader that does not end keeps its log growing"};
+  return {};
 }
 
 // One row at least.
@@ -265,15 +256,14 @@ ForwarderState::Rows ForwarderState::firstStep(Rows rows) const {
   return rows.first(count);
 }
 
-SqliteStatus ForwarderState::acknowledge(Rows rows, uint64_t rejected, std::string_view destination,
-                                         Date now) {
+SqliteStatus ForwarderState::acknowledge(Rows& rows, uint64_t& rejected,
+                                         std::string_view destination, Date now) {
   const uint64_t deliveredBefore = counters_.delivered;
   const size_t acknowledged = rows.size();
-  counters_.lastSuccess = static_cast<uint64_t>(now.time_since_epoch().count());
+  counters_.lastSuccess = microsecondsSince1970(now);
   while (!rows.empty()) {
     const Rows step = firstStep(rows);
-    // The rows of a step that fails are sent again, and the collector rejects its part of them
-    // again. So a step counts no more of the rejected rows than it has.
+    // A step counts no more of the rejected rows than it has, and the last steps count the rest.
     const uint64_t rejectedHere = std::min<uint64_t>(rejected, step.size());
     if (SqliteStatus status = move(step, rejectedHere, destination, now); !status.ok())
       return status;
@@ -290,7 +280,7 @@ SqliteStatus ForwarderState::acknowledge(Rows rows, uint64_t rejected, std::stri
 // disk, or with a table that somebody has changed.
 SqliteStatus ForwarderState::move(Rows rows, uint64_t rejected, std::string_view destination,
                                   Date now) {
-  if (!delivered_.isOpen() || logIsHeld())
+  if (!delivered_.isOpen() || logIsHeld(kHeldLogOfCopies * checkpointPages_))
     return moveOnce(rows, rejected, destination, now, Delivered::dropped);
   SqliteStatus status = moveOnce(rows, rejected, destination, now, Delivered::kept);
   // With these errors the disk or another client is at fault, and not the copy.
@@ -307,16 +297,17 @@ SqliteStatus ForwarderState::moveOnce(Rows rows, uint64_t rejected, std::string_
   counters_.delivered += rows.size();
   counters_.rejected += rejected;
   // Requeued rows have ids below the position. The maximum keeps it from going back.
-  counters_.position = std::max(counters_.position, static_cast<uint64_t>(rows.back()->id));
+  counters_.position =
+      std::max(counters_.position, static_cast<uint64_t>(std::max<int64_t>(rows.back()->id, 0)));
   std::vector<const SpooledEvent*> removed;
   bool good = std::all_of(rows.begin(), rows.end(), [&](const SpooledEvent* row) {
     const bool done = remove_.bind(1, row->id).run();
-    // Another forwarder may have delivered it as well. It then has the copy.
+    // The service removes rows that are past their days, also while they are on their way.
     if (database_.changes() == 1) removed.push_back(row);
     return done;
   });
   if (good && fate == Delivered::kept) good = keep(removed, destination, now);
-  SqliteStatus status = finish(good && writeCounters());
+  SqliteStatus status = finish(good && writeForwarderCounters(count_, counters_));
   // The rollback has kept the rows, so they must not count as delivered.
   if (!status.ok()) counters_ = before;
   return status;
@@ -349,41 +340,46 @@ void ForwarderState::shortenDelivered(Date now) {
     before = delivered_.bytes();
 }
 
+bool ForwarderState::hasRoomToSetAside() {
+  const auto rows = database_.integer("SELECT count(*) FROM forwarder_set_aside");
+  return rows && static_cast<uint64_t>(*rows) < maxSetAside_;
+}
+
 SqliteStatus ForwarderState::setAside(const SpooledEvent& event, int64_t collectorStatus,
                                       std::string_view words, Date now) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
   const ForwarderCounters before = counters_;
   keep_.bind(1, event.id).bind(2, event.time).bind(3, event.name).bind(4, event.payload);
   keep_.bind(5, int64_t{now.time_since_epoch().count()}).bind(6, collectorStatus).bind(7, words);
-  bool good = keep_.run() && remove_.bind(1, event.id).run() &&
-              trim_.bind(1, static_cast<int64_t>(maxSetAside_)).run();
-  if (good) {
-    // changes() tells of the last statement, the trimming. The rows that it deleted are lost.
-    counters_.setAsideDropped += static_cast<uint64_t>(database_.changes());
-    ++counters_.setAside;
-    good = writeCounters();
-  }
-  SqliteStatus status = finish(good);
+  ++counters_.setAside;
+  SqliteStatus status = finish(keep_.run() && remove_.bind(1, event.id).run() &&
+                               writeForwarderCounters(count_, counters_));
   if (!status.ok()) counters_ = before;
   return status;
 }
 
 SqliteStatus ForwarderState::storeCounters() {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
-  return finish(writeCounters());
+  return finish(writeForwarderCounters(count_, counters_));
 }
 
 // The rows keep their ids, so the collector sees the same identifiers again. Their ids are mostly
-// lower than those of the rows that wait, so they mostly go out first.
+// lower than those of the rows that wait, so they mostly go out first. In a spool that was restored
+// from a copy an id may have been given again; such a row gets a new one.
 std::optional<int64_t> ForwarderState::requeue() {
-  const SqliteStatus status = database_.execute(
-      "BEGIN IMMEDIATE;"
-      "INSERT INTO events(id, time, name, payload) SELECT id, time, name, payload FROM "
-      "forwarder_set_aside;");
-  const int64_t rows = database_.changes();
+  SqliteStatus status = database_.execute("BEGIN IMMEDIATE");
+  if (!status.ok()) return {};
+  int64_t rows = 0;
+  for (const char* step :
+       {"INSERT INTO events SELECT id, time, name, payload FROM forwarder_set_aside"
+        " WHERE id NOT IN (SELECT id FROM events)",
+        "INSERT INTO events(time, name, payload) SELECT s.time, s.name, s.payload"
+        " FROM forwarder_set_aside s JOIN events e ON e.id = s.id"
+        " WHERE (e.time, e.name, e.payload) <> (s.time, s.name, s.payload)"}) {
+    if (status.ok()) status = database_.execute(step);
+    if (status.ok()) rows += database_.changes();
+  }
   const bool good = status.ok() && database_.execute("DELETE FROM forwarder_set_aside").ok();
-  // One transaction copied and deleted the rows, so nobody can have added or removed one between.
-  TESSEL_INVARIANT(!good || database_.changes() == rows);
   if (!finish(good).ok()) return {};
   return rows;
 }

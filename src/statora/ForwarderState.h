@@ -18,34 +18,13 @@
 #include <string_view>
 #include <vector>
 
+#include "os/UniqueFd.h"
 #include "platform/System.h"
+#include "statora/ForwarderCounters.h"
 #include "statora/SpoolRows.h"
 #include "statora/Sqlite.h"
 
 namespace tessel {
-
-// What the forwarder has done with this spool since the spool was made.
-struct ForwarderCounters {
-  uint64_t delivered = 0;        // records that a collector took, including rejected ones
-  uint64_t rejected = 0;         // of the delivered ones: those that the collector threw away
-  uint64_t setAside = 0;         // records that were refused and set aside
-  uint64_t setAsideDropped = 0;  // of the set aside ones: the oldest, deleted to keep the limit
-  uint64_t requests = 0;
-  uint64_t retries = 0;
-  uint64_t bytesSent = 0;    // of request bodies, as sent
-  uint64_t position = 0;     // id of the last row that was delivered
-  uint64_t lastSuccess = 0;  // microseconds since 1970; 0: never
-  // Why the collector took nothing when it was last asked in vain. A later success leaves it as it
-  // is. The words are one line that is fit for a terminal.
-  std::string lastError;
-  uint64_t lastErrorAt = 0;   // microseconds since 1970; 0: never
-  uint64_t orderedUntil = 0;  // until when the collector then asked us to wait; 0: it did not
-
-  bool operator==(const ForwarderCounters&) const = default;
-};
-
-// Absent if no forwarder ever worked on this spool.
-std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database);
 
 class ForwarderState {
  public:
@@ -56,8 +35,11 @@ class ForwarderState {
   // Whether there is a spool.
   bool exists() const;
   // Opens the spool. Does nothing if it is open and its file still stands at its path. A missing
-  // spool is a failure: only the service makes one.
+  // spool is a failure: only the service makes one. Another forwarder on the same spool is one, too
+  // (kHeldByAnotherForwarder). The lock stays until this object goes.
   SqliteStatus open();
+  // Counts the files that were opened. The ids of rows mean the same events as long as it stays.
+  uint64_t generation() const { return generation_; }
   // Opens the spool for oldest() and spoolId() alone; nothing in it can be changed.
   SqliteStatus openReadOnly();
   // The following REQUIRE an open spool.
@@ -68,6 +50,8 @@ class ForwarderState {
   SqliteStatus status() const { return database_.status(); }
   // Makes the rows that oldest() has answered survive a power cut. REQUIRES: oldest() was called.
   SqliteStatus flushLog() { return database_.flushLog(); }
+  // One row with an id above `after`, or none. `chance`, at least 0 and below 1, says where.
+  std::vector<SpooledEvent> someEvent(int64_t after, double chance);
   // About how many rows wait. It is the span of their ids, because counting would read the table.
   uint64_t waiting();
   // For the ledger of health records. Valid until the next open().
@@ -75,34 +59,41 @@ class ForwarderState {
 
   // The counters. The next acknowledgement or setting aside stores them.
   ForwarderCounters& counters() { return counters_; }
+  using Rows = std::span<const SpooledEvent* const>;
+  // Writes to the spool, so that a disk without room, another client's lock, or a reader that makes
+  // the log grow shows before rows are sent. `asMuchAsABatch` writes as many bytes as the
+  // acknowledgement of a batch; otherwise a few.
+  SqliteStatus proveWritable(bool asMuchAsABatch);
   // Counts the rows as delivered to `destination` and moves them to the delivered ones, in
   // transactions of a few rows each. `rejected` of them were thrown away by the collector, which
-  // does not say which. If it fails, the rows of the finished transactions are moved and counted,
-  // and the others wait. The ids of `rows` ascend.
-  SqliteStatus acknowledge(std::span<const SpooledEvent* const> rows, uint64_t rejected,
-                           std::string_view destination, Date now);
+  // does not say which. If it fails, `rows` and `rejected` are what is still to be done: the rows
+  // of the finished transactions are moved and counted. The ids of `rows` ascend.
+  SqliteStatus acknowledge(Rows& rows, uint64_t& rejected, std::string_view destination, Date now);
   // Removes delivered rows that are past their days, or more than the limits allow.
   void shortenDelivered(Date now);
-  // Moves a row to the table of refused rows, with the collector's answer. If the table then has
-  // more rows than the limit, its oldest row is deleted.
+  // Whether the table of refused rows may take one more. Its limit keeps a collector that refuses
+  // much from filling the disk.
+  bool hasRoomToSetAside();
+  // Moves a row to that table, with the collector's answer.
   SqliteStatus setAside(const SpooledEvent& event, int64_t collectorStatus, std::string_view words,
                         Date now);
   // Stores the counters alone.
   SqliteStatus storeCounters();
-  // Puts all rows that were set aside back among those that wait, and answers their number. If that
-  // fails, the answer is absent and nothing has changed.
+  // Puts all rows that were set aside back among those that wait, and answers their number. A row
+  // keeps its id, unless another row has it by now. If that fails, the answer is absent and nothing
+  // has changed.
   std::optional<int64_t> requeue();
   // Gives up to `pages` pages of free space back to the file system. False if there was none.
   bool shrink(int pages);
 
  private:
+  SqliteStatus lock();
   SqliteStatus openFresh(SqliteDatabase::Mode mode);
   SqliteStatus openAndPrepare();
   SqliteStatus prepareStatements();
   bool isStillThere() const;
   // What happens to rows that are delivered.
   enum class Delivered { kept, dropped };
-  using Rows = std::span<const SpooledEvent* const>;
 
   Rows firstStep(Rows rows) const;
   SqliteStatus move(Rows rows, uint64_t rejected, std::string_view destination, Date now);
@@ -110,20 +101,22 @@ class ForwarderState {
                         Delivered fate);
   bool keep(Rows rows, std::string_view destination, Date now);
   bool shortenBy(uint64_t added);
-  bool logIsHeld();
+  bool logIsHeld(int64_t pages);
   void readLimits();
   static int afterCommit(void* self, sqlite3* handle, const char* schema, int logPages);
-  bool writeCounters();
   SqliteStatus finish(bool good);
 
+  const std::string directory_;
   const std::string path_;
   const uint64_t maxSetAside_;
   SqliteDatabase database_;
+  UniqueFd lock_;
+  uint64_t generation_ = 0;
   uint64_t device_ = 0;
   uint64_t inode_ = 0;
   std::string spoolId_;
   ForwarderCounters counters_;
-  SqliteStatement select_, remove_, keep_, trim_, count_, pageCount_, freePages_;
+  SqliteStatement select_, remove_, keep_, count_, pageCount_, freePages_;
   DeliveredRows delivered_{database_};
   SpoolLimits limits_;
   int64_t checkpointPages_ = 0;

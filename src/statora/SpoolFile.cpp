@@ -100,6 +100,15 @@ SqliteStatus prepareSchema(SqliteDatabase& database) {
 
 }  // namespace
 
+// A newer service may only have added to the spool. It then says in `compatible_from` the oldest
+// version that still finds its way. Without that word a newer spool may mean anything, and sending
+// rows that we do not understand cannot be taken back.
+bool isUnderstoodSpool(SqliteDatabase& database, int64_t version) {
+  if (version <= kSpoolSchemaVersion) return version == kSpoolSchemaVersion;
+  const auto oldest = database.integer("SELECT value FROM meta WHERE key='compatible_from'");
+  return oldest && *oldest >= 1 && *oldest <= kSpoolSchemaVersion;
+}
+
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds) {
   makeFile(path);

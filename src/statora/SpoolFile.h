@@ -30,6 +30,9 @@ inline constexpr int kSpoolSchemaVersion = 1;
 SqliteStatus openSpoolDatabase(SqliteDatabase& database, const std::string& path,
                                int busyTimeoutMilliseconds);
 
+// Whether a forwarder of this version may deliver the rows of a spool of schema version `version`.
+bool isUnderstoodSpool(SqliteDatabase& database, int64_t version);
+
 // Renames a damaged spool, with its log, to `statora.db.damaged-<UTC date>`. Nobody of this process
 // may have it open. Answers the new file name; absent if that failed.
 std::optional<std::string> setSpoolAside(const std::string& stateDirectory, Date now);

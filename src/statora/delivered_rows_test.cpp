@@ -55,8 +55,10 @@ class DeliveredRowsTest : public ::testing::Test {
       if (events.empty()) break;
       std::vector<const SpooledEvent*> rows;
       for (const SpooledEvent& event : events) rows.push_back(&event);
+      ForwarderState::Rows left = rows;
+      uint64_t rejected = 0;
       ASSERT_TRUE(
-          state_->acknowledge(rows, 0, "https://collector.example:4318", clock_.now()).ok());
+          state_->acknowledge(left, rejected, "https://collector.example:4318", clock_.now()).ok());
     }
     while (state_->shrink(64)) continue;
   }

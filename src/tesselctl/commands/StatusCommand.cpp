@@ -99,8 +99,9 @@ void writeMarkers(JsonWriter& json, const std::vector<Marker>& markers) {
 void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("delivered", counters.delivered).member("rejected", counters.rejected);
   json.member("set_aside", counters.setAside);
-  json.member("set_aside_dropped", counters.setAsideDropped);
   json.member("requests", counters.requests).member("retries", counters.retries);
+  json.member("refused_requests", counters.refusedRequests);
+  json.member("failed_requests", counters.failedRequests);
   json.member("bytes_sent", counters.bytesSent).member("position", counters.position);
   json.member("last_success", counters.lastSuccess);
   if (counters.lastErrorAt == 0) return;

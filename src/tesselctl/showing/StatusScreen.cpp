@@ -234,8 +234,10 @@ class Screen {
     const bool trouble = counters.rejected + counters.setAside > 0;
     std::string words = grouped(counters.delivered) + " delivered in " +
                         counted(counters.requests, "request", "requests") + ", " +
-                        grouped(counters.retries) + " again, " + grouped(counters.rejected) +
-                        " rejected, " + grouped(counters.setAside) + " set aside";
+                        grouped(counters.refusedRequests) + " of them refused and " +
+                        grouped(counters.failedRequests) + " failed on the way, " +
+                        grouped(counters.rejected) + " rejected, " + grouped(counters.setAside) +
+                        " set aside";
     if (counters.lastSuccess != 0) {
       const auto last = static_cast<int64_t>(counters.lastSuccess);
       words += "; last " + since(Date{std::chrono::microseconds{last}});
