@@ -58,7 +58,8 @@ class Store:
         for name, text in (("config.xml", CONFIG), ("users.xml", USERS)):
             with open(os.path.join(self.root, name), "w", encoding="utf-8") as file:
                 file.write(text.format(port=self.port, root=self.root))
-        libraries = [os.path.join(unpacked, "usr/lib/x86_64-linux-gnu"), os.path.join(unpacked, "usr/lib")]
+        # Debian's packages use four folders for libraries, and the loader knows none of these.
+        libraries = [os.path.join(unpacked, top, below) for top in ("usr/lib", "lib") for below in ("x86_64-linux-gnu", "")]
         self.environment = {**os.environ, "LD_LIBRARY_PATH": ":".join(libraries)}
         self.program = os.path.join(unpacked, "usr/sbin/clickhouse-server")
         self.url = f"http://127.0.0.1:{self.port}/"
@@ -74,7 +75,8 @@ class Store:
                 if self.process.poll() is not None:
                     break
                 time.sleep(0.1)
-        raise RuntimeError("the store does not start: " + self.root + "/log")
+        with open(os.path.join(self.root, "log"), encoding="utf-8", errors="replace") as log:
+            raise RuntimeError("the store does not start: " + log.read()[-1000:])
 
     def kill(self):
         self.process.send_signal(signal.SIGKILL)
