@@ -192,6 +192,8 @@ TEST_P(JournalDamageTest, TellsOfEachFieldThatCannotBeRead) {
   JournalWriter writer({.compact = GetParam(), .keyed = GetParam()});
   writer.add({.monotonic = 1, .realtime = 1}, {"MESSAGE=one", "PRIORITY=1"});
   writer.add({.monotonic = 2, .realtime = 2}, {"MESSAGE=two", "PRIORITY=2"});
+  const std::string loss = "MESSAGE_ID=a596d6fe7bfa4994828e72309e95d61e";
+  writer.add({.monotonic = 3, .realtime = 3}, {loss, "N_DROPPED=3", "_TRANSPORT=driver"});
   const uint64_t text = writer.dataOf("MESSAGE=two");
   const size_t head = layout().compact ? kCompactDataHeaderSize : kDataHeaderSize;
   const std::pair<std::vector<std::string>, std::function<void(std::string&)>> faults[] = {
@@ -203,12 +205,14 @@ TEST_P(JournalDamageTest, TellsOfEachFieldThatCannotBeRead) {
          std::memcpy(&file[writer.entries()[1] + kEntryItemsAt], &noData, sizeof noData);
        }},
       {{}, [&](std::string& file) { put(file, writer.entries()[1] + kEntryHashAt, 1); }},
+      {{"MESSAGE=two", "PRIORITY=2"},
+       [&](std::string& file) { file[writer.dataOf(loss) + head + 20] = 'x'; }},
   };
   for (const auto& [left, fault] : faults) {
     std::string file = writer.bytes();
     fault(file);
     const Fields fields = fieldsIn(directory_.write("a.journal", file));
-    ASSERT_EQ(fields.entries.size(), 2u);
+    ASSERT_EQ(fields.entries.size(), 3u);
     EXPECT_EQ(fields.entries[1].fields, left) << &left - &faults[0].first;
     EXPECT_THAT(fields.problems, ::testing::ElementsAre(::testing::EndsWith("damaged")));
   }

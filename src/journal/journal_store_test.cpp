@@ -186,6 +186,12 @@ TEST(JournalStoreTest, FiltersEachEntryByASetBackClock) {
   EXPECT_EQ(numbers(readStore(directory.path(), {1005, 1008})),
             (std::vector<uint64_t>{5, 6, 7, 35, 36, 37}));
   EXPECT_EQ(numbers(readStore(a, {999, 1002})), (std::vector<uint64_t>{1, 29, 30, 31}));
+  // Its header has the times of the first and the last entry, and the range lies behind both.
+  JournalWriter back;
+  for (const uint64_t time : {2000u, 2005u, 1000u})
+    back.add({.monotonic = 3000 - time, .realtime = time}, {"PRIORITY=6"});
+  EXPECT_EQ(numbers(readStore(directory.write("back.journal", back.bytes()), {2003, 2008})),
+            (std::vector<uint64_t>{2}));
 }
 
 // One daemon numbers the entries of all its files, though a user's file has a sequence of its own.

@@ -144,6 +144,7 @@ TEST_F(SharesTest, theLastQuarterIsForThoseWhoHoldLittle) {
   EXPECT_EQ(got("|_UID=7", 50), 16u) << "without owner and executable: the unknown writer";
   EXPECT_EQ(got("|_UID=8", 50) + got("", 50), 0u) << "he is one, whatever users he had";
   EXPECT_EQ(got("|_UID=8|_SYSTEMD_OWNER_UID=9", 50), 16u);
+  EXPECT_EQ(got("|_UID=10|_EXE=/a", 50), 0u) << "all are given away";
   process({tracePoint("event|CATEGORY=100000|_UID=1|_EXE=/f")});
   EXPECT_EQ(delivered.back(), "Event 100000") << "who holds a pair does not matter";
   EXPECT_EQ(extractor().report().pairs, delivered.size() - 1);

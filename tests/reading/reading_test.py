@@ -92,13 +92,16 @@ class Files(ReadingTest):
         os.rename(archived, archived + "~")
         self.assert_all_agree(self.folder, entries=3700, duplicates=1000, files=4)
 
-    def test_a_file_without_permission_is_named(self):
+    def test_what_has_no_permission_is_named(self):
         hidden = self.make("a.journal", exported(10))
         os.chmod(hidden, 0o600)
         os.chmod(self.make("b.journal", exported(10, source=1)), 0o644)
+        closed = os.path.join(self.folder, "closed")
+        os.mkdir(closed, 0o700)
         result = read(self.folder, "--ours", user=65534, group=65534, extra_groups=[])
         self.assertEqual(result.figures["entries"], 10)
         self.assertIn(f"skipped {hidden}: Permission denied", result.stdout)
+        self.assertIn(f"skipped {closed}: Permission denied", result.stdout)
 
 
 class Live(ReadingTest):
