@@ -158,7 +158,7 @@ class Messages(MachineTest):
         for arguments in (("events",), ("events", "--json"), ("events", "--sent")):
             result = self.machine.ctl(*arguments)
             self.assertEqual((result.status, result.out, result.errors.count("\n")), (0, "", 1), result.errors)
-            self.assertIn("Nothing was sent", result.errors)
+            self.assertIn("Nothing was reported", result.errors)
 
 
 class Dates(MachineTest):

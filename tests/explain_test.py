@@ -153,6 +153,7 @@ class MixedDay(ExplainTest):
         self.machine.write_export([point("event", "com.vantor.Old", "A", "Gone", at=-90000),
                                    point("event", "com.vantor.Both", "A", "Stays", at=-90000),
                                    point("event", "com.vantor.Both", "A", "Stays", at=-50),
+                                   point("event", "com.vantor.NoName", "A", at=-50),
                                    point("event", "com.vantor.Fresh", "A", "Comes", at=-50)], "b.export")
         result = self.machine.ctl("compare", "since=-26h,until=-24h", "last=2h", "--json")
         self.assert_clean(result)
@@ -161,6 +162,9 @@ class MixedDay(ExplainTest):
         self.assertEqual(changes["com.vantor.Old"], ("stop", 1, "not_recorded"))
         self.assertEqual(changes["com.vantor.Fresh"], ("start", 1, "not_recorded"))
         self.assertNotIn("com.vantor.Both", changes)
+        text = self.machine.ctl("compare", "since=-26h,until=-24h", "last=2h").out
+        self.assertRegex(text, r"(?m)^only in A\t1\tcom.vantor.Old / A / Gone\tnot recorded$")
+        self.assertNotRegex(text, "would start|RULE|not_recorded|/ \t")
 
     def test_compare_counts_what_it_has_no_room_for(self):
         names = [*range(65_530), *range(65_520, 65_530), *range(65_530, 65_560)]
@@ -317,8 +321,36 @@ class Reading(ExplainTest):
         self.assertEqual(store["dropped"], [{"unit": "vantor.service", "count": 7}])
         self.assertEqual(self.summary()["without_exe"], 1)
         text = self.machine.ctl("explain", "--summary").out
-        for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed or lost", "(vantor.service)", "process gone before _EXE was read"):
+        for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed, not exported or lost", "(vantor.service)", "process gone before _EXE was read"):
             self.assertIn(words, text)
+        self.machine.write_export([log_event("young", at=-80), log_event("dated back", at=-9e5), log_event("young", at=-70)])
+        os.unlink(os.path.join(self.machine.store, "b.export"))
+        self.assertEqual(self.summary()["store"]["missing"], 0, "the entry of another time has the number")
+
+    def test_what_is_no_row_is_told_beside_the_rows(self):
+        self.machine.write_export([log_event("plain"), point("begin", "com.vantor.A", "B", "Opens", at=-50),
+                                   point("event", "com.vantor.A", "B", "Quiet", telemetry=False), point("evnt", "a", "b"),
+                                   point("event", "com.vantor.A", "B", "Loud")])
+        begin = "1 begin waits for its end, and is no trace object before: com.vantor.A / B / Opens\n"
+        lost = "Lost: 1 malformed: unknown TESSEL_KIND\n"
+        looked = "5 log events with 2 trace objects looked at, in " + self.machine.store + ", 20"
+        off = "Reporting is off on this machine: there is no "
+        for arguments, rows, said, unsaid in (
+                ((), 2, [begin, lost], [looked, off]), (("--json",), 2, [], [begin, looked]),
+                (("--name", "Qiet"), 0, [looked, "--name Qiet fits none of 3 names; near: Quiet\n"], [begin, off]),
+                (("--name", "open*"), 0, [looked, "--name open* fits none of 3 names; near: Opens\n"], [begin]),
+                (("--name", "Opens"), 0, [looked, begin], ["fits none", "each pattern"]),
+                (("--name", "Quiet", "--verdict", "reported"), 0, ["each pattern fits something, but no trace object fits all"], []),
+                (("--store", self.machine.store, "--last", "1s"), 0, ["No trace object: 0 log events looked at"], [off])):
+            result = self.assert_clean(self.machine.ctl("explain", *arguments))
+            self.assertEqual(result.out.count("\n"), rows, arguments)
+            for words in said:
+                self.assertIn(words, result.errors, arguments)
+            for words in unsaid:
+                self.assertNotIn(words, result.errors, arguments)
+        self.machine.task('{"TaskedOn": false}')
+        self.assertIn("Reporting is off on this machine: ", self.machine.ctl("explain").errors)
+        self.assertNotIn("is off", self.machine.ctl("explain", "--store", self.machine.store).errors, "it may be another's")
 
     def test_a_damaged_file_is_named_and_the_rest_is_read(self):
         self.machine.write_export([point("event", "com.vantor.A", "B", "C")])

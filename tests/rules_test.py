@@ -39,7 +39,7 @@ class Rules(MachineTest):
             ("Selvin", True, ("com.vantor.Calendar", "View", "Open"), [("period", "weekly")], True, "internal"),
             ("Quarro", False, ("com.vantor.Calendar", "View", "Open"), [("period", "week")], False, "known on Selvin"),
             ("Selvin", False, ("com.vantor.TextInput", "Keys", "Show"), [], True, "one in 503"),
-            ("Selvin", True, ("com.vantor.quellan.knowledge", "tessel", "Footprint"), [], False, "none is sent"),
+            ("Selvin", True, ("com.vantor.quellan.knowledge", "tessel", "Footprint"), [], False, "none is reported"),
             ("Quarro", True, PERFORMANCE, [("c", "Application"), ("a", "Open")], True, "actions"),
             ("Quarro", True, PERFORMANCE, [("c", "Application"), ("a", "open")], False, "known are Open"),
             ("Quarro", True, PERFORMANCE, [], False, "string 1, which is absent"),

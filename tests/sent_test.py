@@ -91,9 +91,9 @@ class Shown(SentTest):
         said = self.machine.ctl("events")
         self.assertEqual({len(line.split("\t")) for line in said.out.splitlines()}, {6})
         self.assertEqual([line.split("\t")[4] for line in said.out.splitlines()], [url] * count + [""] * count)
-        self.assertIn(f"{count} rows wait, {count} rows sent and still here\n{count} rows to {url}, the last at 20", said.errors)
+        self.assertIn(f"{count} rows wait, {count} rows delivered and still here\n{count} rows to {url}, the last at 20", said.errors)
         whole = self.machine.ctl("events", "show", "1").out
-        self.assertRegex(whole, f"Sent +20.* to {url}\n")
+        self.assertRegex(whole, f"Delivered +20.* to {url}\n")
         self.assertIn(f"ids go from 1 to {2 * count}", self.machine.ctl("events", "show", "999").errors)
         self.assertEqual(self.machine.ctl("events", "--sent", "--waiting").status, 2)
         # Yesterday's events that were delivered today: the day of the delivery counts for --sent.

@@ -7,7 +7,7 @@ import subprocess
 import time
 
 import harness
-from harness import BIN, wait_for
+from harness import BIN, log_event, some_points, wait_for
 from otlp_receiver import Answer, Receiver
 from status_case import NOBODY, STRANGER, StatusTest, up_for
 
@@ -50,6 +50,15 @@ class Machine(StatusTest):
         self.age(self.state("defer"), 5)
         self.machine.ctl("defer", "off")
         self.assertEqual(self.problems(), {})
+        pressure = os.path.join(self.machine.root, "cpu")
+        by_machine = {"before": ("/bin/sh", "-c", f'mount -n --bind {pressure} /proc/pressure/cpu && exec "$0" "$@"'),
+                      "TESSEL_DEFER_ON": "pressure"}
+        for avg10, hours, problems in (("99.00", 23, {}), ("99.00", 25, {"deferred": None}), ("0.00", 25, {})):
+            with open(pressure, "w", encoding="utf-8") as file:
+                file.write(f"some avg10={avg10} avg60=0.00 avg300=0.00 total=0\n")
+            with open(self.state("scheduler-put-off"), "w", encoding="utf-8") as file:
+                file.write(f"{hours * 3600}\n")
+            self.assertEqual(self.problems(**by_machine), problems, (avg10, hours))
 
     def test_a_state_directory_that_cannot_be_written(self):
         self.service()
@@ -61,6 +70,12 @@ class Machine(StatusTest):
         os.mkdir(self.state("last_run.json"))
         self.assertIn("record_unwritable", self.problems())
         os.rmdir(self.state("last_run.json"))
+        self.service()
+        self.assertEqual(self.problems(), {})
+        def without_end(record):
+            del record["runs"][-1]["end"], record["runs"][-1]["outcome"]
+        self.change_record(without_end)
+        self.assertEqual(self.problems(), {"record_unwritable": None}, "the scheduler knows that this run ended well")
         self.service()
         self.assertEqual(self.problems(), {})
 
@@ -85,6 +100,11 @@ class Machine(StatusTest):
         self.assertEqual((result.status, status["good"], [found["code"] for found in status["problems"]]),
                          (4, False, ["no_access"]))
         self.assertNotIn("no_completed_run", status["checked"])
+        for folder in (self.machine.state, self.machine.store, self.machine.config):
+            os.chmod(folder, 0o755)
+        os.chmod(self.state("last_run.json"), 0o644)
+        os.chmod(self.state("statora.db"), 0o644)
+        self.assertEqual(self.status(before=NOBODY)["problems"], [])
 
     def test_a_tasking_file_that_says_nothing(self):
         for text in ('{"TaskedOn": "yes"}', "{"):
@@ -98,6 +118,10 @@ class Machine(StatusTest):
         open(self.machine.state, "w", encoding="utf-8").close()
         self.assertIn("record_unwritable", self.problems())
         self.assertIn("Not a directory", self.problem("record_unwritable")["words"])
+
+    def test_an_export_file_may_hold_older_entries(self):
+        self.machine.write_export(some_points(1) + [log_event("old", at=-90000)])
+        self.assertRegex(self.call("tesselctl", "status").out, r"Journal +part of day +\S+: first entry .* may hold older entries further on")
 
     def test_without_a_state_directory(self):
         os.rmdir(self.machine.state)

@@ -7,7 +7,7 @@ import time
 import unittest
 
 import harness
-from harness import Entry, point, some_points, wait_for
+from harness import Entry, log_event, point, some_points, wait_for
 from otlp_receiver import Answer
 from status_case import CODES, STRANGER, UP_FOR_DAYS, Bus, StatusTest, up_for
 
@@ -28,8 +28,19 @@ class LastRun(StatusTest):
         self.service(TESSEL_TRACE_STORE="/nowhere")
         self.assertEqual(self.problems(), {"run_failed": None})
         self.assertIn("/nowhere", self.problem("run_failed")["words"])
+        gone = {"TESSEL_TRACE_STORE": "/nowhere"}
+        self.assertEqual(self.problems(**gone), {"store_unreadable": None, "run_failed": "store_unreadable"})
+        self.machine.task('{"TaskedOn": false}')
+        self.assertEqual(self.problems(), {"run_failed": None}, "no run came since")
+        self.service()
+        self.assertEqual(self.problems(), {}, "one came to its end, and had nothing to do")
+        self.assertRegex(self.call("tesselctl", "status").out, "All in all +off +this machine reports nothing; none of these")
+        self.machine.task()
+        self.assertEqual(self.problems(), {"run_failed": None}, "the last one that was to report")
         self.service()
         self.assertEqual(self.problems(), {})
+        self.assertEqual(self.problems(**gone), {"store_unreadable": None}, "the next one would fail")
+        self.assertRegex(self.call("tesselctl", "status").out, "Settings +set here +TESSEL_CONFIG_DIR, .*TESSEL_STATE_DIR.*systemctl cat")
 
     def test_refused_rows_and_why(self):
         self.service()
@@ -97,8 +108,14 @@ class LastRun(StatusTest):
         self.assertEqual([note["code"] for note in status["notes"]],
                          ["dropped_by_daemon", "malformed", "store_begins_late"])
         self.assertTrue(status["good"])
+        self.change_record(lambda record: record.update(outcome="interrupted"))
+        self.assertIn("run_cut_short", [note["code"] for note in self.status()["notes"]])
         text = self.call("tesselctl", "status").out
         self.assertLess(text.index("malformed "), text.index("All in all"))
+        os.unlink(os.path.join(self.machine.store, "b.export"))
+        self.machine.write_export([log_event("old", at=-90000)] + some_points(1))
+        self.service()
+        self.assertEqual(self.status()["notes"], [])
 
 
 class Runs(StatusTest):
@@ -229,9 +246,17 @@ class NextRun(StatusTest):
         address = {"TESSEL_STATE_DIR": None, "DBUS_SYSTEM_BUS_ADDRESS": "unix:path=" + path}
         self.assertEqual(self.status(**address)["next_run"], {"by": "nothing"}, "nobody answers")
         self.assertRegex(self.call("tesselctl", "status", **address).out, r"Next run +unknown +no service manager answers")
-        Bus(path, 0)
-        self.assertRegex(self.call("tesselctl", "status", **address).out, r"Next run +unknown +tessel-reporter.timer is not active; 'systemctl")
-        os.unlink(path)
+        for tasked, word, notes in ((True, "idle", ["nothing_starts_runs"]), (False, "off", [])):
+            self.machine.task(json.dumps({"TaskedOn": tasked}))
+            Bus(path, 0)
+            text = self.call("tesselctl", "status", **address).out
+            self.assertRegex(text, r"(?s)Next run +unknown +tessel-reporter.timer is not active; 'systemctl.*All in all +" + word)
+            os.unlink(path)
+            Bus(path, 0)
+            status = self.status(**address)
+            self.assertEqual((status["good"], [note["code"] for note in status["notes"]]), (True, notes))
+            os.unlink(path)
+        self.machine.task()
         at = int((time.time() + 7200) * 1e6)
         bus = Bus(path, at)
         self.assertEqual(self.status(**address)["next_run"], {"by": "timer", "at": at})

@@ -194,7 +194,7 @@ class Status(CtlTest):
         self.assertEqual(reading["problems"], [{"path": damaged, "files": 1, **problem}])
         text = re.sub(r"\s+", " ", self.machine.ctl("status").out)
         for words in ("Store not whole 3 files and 4 entries read The store reaches back to",
-                      "7 entries_missing: numbers that no file holds: vacuumed or lost, in 1 gap", "7 dropped_by_daemon: ", "(vantor.service)",
+                      "7 entries_missing: numbers that no file holds: vacuumed, not exported or lost, in 1 gap", "7 dropped_by_daemon: ", "(vantor.service)",
                       "1 no_image_path: process gone before _EXE was read", f"1 file_skipped: {files[refused]['skipped']} (",
                       "\\x1bd.journal", f"1 file_damaged: {problem['reason']} (", "byte 0)"):
             self.assertIn(words, text)

@@ -105,12 +105,13 @@ bool JournalStore::State::next() {
   while (merger.next()) {
     const EntryHeader& entry = merger.header();
     if (++entriesMerged % kEntriesPerStep == 0) makeProgress();
-    // Entries outside the range show how far back the store reaches. Their numbers do not matter:
-    // further ones of them may stand in files that are not read.
+    // Entries outside the range show how far back the store reaches. Further ones of them may stand
+    // in files that are not read, so gaps among them mean nothing.
     seeTime(entry.realtime);
-    if (entry.realtime < range.start || entry.realtime >= range.end) continue;
+    const bool inRange = entry.realtime >= range.start && entry.realtime < range.end;
     const uint32_t file = merger.streamNumber();
-    numbers.see(counters[file], entry);
+    numbers.see(counters[file], entry, inRange);
+    if (!inRange) continue;
     ++facts.reading.entriesRead;
     ++facts.files[file].entriesRead;
     // The daemon's loss messages end here, so that the user sees only tokens of its own, and so
@@ -288,7 +289,7 @@ StoreReport JournalStore::report() const {
   // size.
   if (!reading.losses.empty())
     reading.losses.add(LossCode::entriesMissing,
-                       "numbers that no file holds: vacuumed or lost, in " +
+                       "numbers that no file holds: vacuumed, not exported or lost, in " +
                            std::to_string(reading.sequenceGaps) +
                            (reading.sequenceGaps == 1 ? " gap" : " gaps"),
                        {}, reading.missingNumbers);

@@ -5,6 +5,10 @@
 // files together show whether numbers are missing. We look at each boot by itself, because the
 // counter may begin anew with it.
 //
+// Only numbers between two entries of the period count. An entry of another time may stand between
+// them, since a writer of export files can give it any time: it has its number, and none is
+// missing.
+//
 // A missing number alone is no loss of ours: the daemon removes old files, and a user's sooner than
 // its own. It tells how much was lost where something else tells that there is a loss.
 //
@@ -23,11 +27,12 @@ namespace tessel {
 class NumberWatch {
  public:
   // `counter` is equal for all files whose entries one daemon numbers. Entries come in their order,
-  // but those of several files may change places with their neighbours.
-  void see(uint32_t counter, const EntryHeader& entry) {
+  // but those of several files may change places with their neighbours. `inPeriod` is false for
+  // entries of another time.
+  void see(uint32_t counter, const EntryHeader& entry, bool inPeriod) {
     if (last_ == nullptr || last_->counter != counter || !sameId(last_->boot, entry.bootId))
         [[unlikely]] {
-      if (!find(counter, entry)) return;
+      if (!find(counter, entry, inPeriod)) return;
     }
     Row& row = *last_;
     if (entry.sequenceNumber == row.number + 1) [[likely]] {
@@ -35,16 +40,20 @@ class NumberWatch {
     } else if (entry.sequenceNumber != 0) {
       advance(row, entry.sequenceNumber);
     }
+    if (inPeriod && entry.sequenceNumber > row.lastOfPeriod)
+      row.lastOfPeriod = entry.sequenceNumber;
   }
   uint64_t gaps() const {
     uint64_t gaps = 0;
-    for (const Row& row : rows_) gaps += row.gaps.size();
+    for (const Row& row : rows_)
+      for (const Gap& gap : row.gaps) gaps += gap.last < row.lastOfPeriod ? 1 : 0;
     return gaps;
   }
   uint64_t missing() const {
     uint64_t missing = 0;
     for (const Row& row : rows_)
-      for (const Gap& gap : row.gaps) missing += gap.last - gap.first + 1;
+      for (const Gap& gap : row.gaps)
+        missing += gap.last < row.lastOfPeriod ? gap.last - gap.first + 1 : 0;
     return missing;
   }
 
@@ -66,17 +75,18 @@ class NumberWatch {
     Id128 boot;
     uint64_t number;        // the greatest so far
     std::vector<Gap> gaps;  // numbers below it that did not come yet, rising
+    uint64_t lastOfPeriod = 0;
   };
 
-  [[gnu::noinline]] bool find(uint32_t counter, const EntryHeader& entry) {
+  [[gnu::noinline]] bool find(uint32_t counter, const EntryHeader& entry, bool inPeriod) {
     if (entry.sequenceNumber == 0) return false;
     const auto known = std::find_if(rows_.begin(), rows_.end(), [&](const Row& row) {
       return row.counter == counter && row.boot == entry.bootId;
     });
-    if (known == rows_.end() && rows_.size() == kMaxRows) return false;
+    if (known == rows_.end() && (!inPeriod || rows_.size() == kMaxRows)) return false;
     last_ = known != rows_.end()
                 ? &*known
-                : &rows_.emplace_back(Row{counter, entry.bootId, entry.sequenceNumber, {}});
+                : &rows_.emplace_back(Row{counter, entry.bootId, entry.sequenceNumber, {}, 0});
     return true;
   }
 

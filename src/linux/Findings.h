@@ -36,6 +36,7 @@ enum class FindingCode : uint8_t {
   noCompletedRun,
   // Notes. Any user of the machine can cause one, or it is no fault of anybody. If they were
   // problems, any user could make a machine look broken.
+  nothingStartsRuns,
   runCutShort,
   lostAtSource,
   droppedByDaemon,
@@ -45,9 +46,9 @@ enum class FindingCode : uint8_t {
   storeBeginsLate,
   spoolSetAside,
 };
-inline constexpr size_t kFindingCodes = 24;
+inline constexpr size_t kFindingCodes = 25;
 
-constexpr bool isProblem(FindingCode code) { return code < FindingCode::runCutShort; }
+constexpr bool isProblem(FindingCode code) { return code < FindingCode::nothingStartsRuns; }
 // The name for programs, such as "rows_refused". It never changes.
 std::string_view findingName(FindingCode code);
 

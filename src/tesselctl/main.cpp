@@ -16,7 +16,7 @@ constexpr std::string_view kComplete = "--complete";
 
 std::string footer() {
   return helpTable("What answers which question",
-                   {{"tesselctl explain", "why was this trace point not sent?"},
+                   {{"tesselctl explain", "why was this trace point not reported?"},
                     {"tesselctl rules check WORD", "may I write this word?"},
                     {"tesselctl events --sent", "what left this machine?"},
                     {"tesselctl status", "is this machine well?"},

@@ -252,6 +252,13 @@ TracePointFields IntervalAssembler::fieldsOf(const PointTokens& tokens,
   return fields;
 }
 
+void IntervalAssembler::forEachOpen(const OpenVisitor& visit) const {
+  open_.forEach([&](const OpenInterval& interval) {
+    const auto text = [&](FieldKind kind) { return table_.text(tokenOf(interval.tokens, kind)); };
+    visit(text(FieldKind::subsystem), text(FieldKind::category), text(FieldKind::name));
+  });
+}
+
 EmittingProcess IntervalAssembler::processOf(const PointTokens& tokens) const {
   return {table_.text(tokenOf(tokens, FieldKind::imagePath)),
           table_.text(tokenOf(tokens, FieldKind::processName))};

@@ -15,6 +15,7 @@
 #pragma once
 
 #include <array>
+#include <functional>
 #include <memory>
 #include <optional>
 
@@ -77,6 +78,10 @@ class IntervalAssembler {
   // starts a new generation here.
   void consume(const Entry& entry);
   AssemblyCounts counts() const;
+  // The subsystem, category and name of each begin that waits for its end. The name may be absent.
+  // All are borrowed until the next consume().
+  using OpenVisitor = std::function<void(StringRef subsystem, StringRef category, StringRef name)>;
+  void forEachOpen(const OpenVisitor& visit) const;
   // The writer of the current entry. REQUIRES: called by the sink.
   Origin writer() const { return writerOf(table_, point_.tokens); }
   // The process of the current entry. Objects do not have it: a run needs no more than its name,

@@ -93,6 +93,10 @@ class JournalExtractor final : public TesselSupportObjectExtractor, private Trac
   const EntryHeader& currentEntry() const { return *current_; }
   // The process that wrote that entry. REQUIRES: a callback is running.
   EntryProcess currentProcess() const { return assembler_.process(); }
+  // The begins that wait for their end.
+  void forEachOpen(const IntervalAssembler::OpenVisitor& visit) const {
+    assembler_.forEachOpen(visit);
+  }
   // The books so far. processLogArchiveWithPath() fills in the store's part when it ends. A caller
   // of processEntries() reads a store of its own and passes that store's report.
   ExtractionReport report() const { return report(report_.store); }

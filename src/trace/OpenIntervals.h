@@ -90,6 +90,10 @@ class OpenIntervals {
   void renewAll(const std::function<std::optional<size_t>(OpenInterval&)>& renew);
 
   size_t size() const { return intervals_.total(); }
+  void forEach(const std::function<void(const OpenInterval&)>& visit) const {
+    for (const Node& node : nodes_)
+      if (node.isOpen) visit(node);
+  }
 
  private:
   static constexpr uint32_t kNone = FlatIndex::kNone;

@@ -2,7 +2,6 @@
 
 #include "tesselctl/commands/Command.h"
 
-#include <fnmatch.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -153,13 +152,6 @@ CLI::Option* addPatterns(CLI::App& command, const char* name, std::vector<std::s
                          const char* help) {
   // Each --name takes one word. If it took more, it would swallow the words that follow it.
   return command.add_option(name, patterns, help)->allow_extra_args(false)->type_name("PATTERN");
-}
-
-bool fitsOne(const std::vector<std::string>& patterns, const std::string& text) {
-  return patterns.empty() ||
-         std::any_of(patterns.begin(), patterns.end(), [&](const std::string& pattern) {
-           return ::fnmatch(pattern.c_str(), text.c_str(), 0) == 0;
-         });
 }
 
 std::vector<std::string> platformWords() {

@@ -144,9 +144,6 @@ void addJudgeOptions(CLI::App& command, ReadingOptions& options);
 // Adds an option that takes a pattern and may be repeated.
 CLI::Option* addPatterns(CLI::App& command, const char* name, std::vector<std::string>& patterns,
                          const char* help);
-// Whether `text` fits one of the patterns. A pattern may hold *, ? and [...]. Without patterns each
-// text fits.
-bool fitsOne(const std::vector<std::string>& patterns, const std::string& text);
 
 // The meaning of the options. The environment supplies the values of options that are not given.
 struct Reading {

@@ -130,39 +130,50 @@ std::string comparisonHeading(const Setting (&settings)[2], const CompareOptions
   return out;
 }
 
-std::string comparisonText(const Comparison& comparison, const std::string& heading,
+// Over two periods nothing starts or stops by a setting: a trace point was reported in one of them
+// and not in the other, and may just not have been recorded there.
+std::string changesText(const Comparison& comparison, bool same, const Terminal& terminal) {
+  const auto objects = [](uint64_t count) { return counted(count, "object", "objects"); };
+  const Changes& changes = comparison.changes;
+  const std::string starting = objects(changes.starting()), stopping = objects(changes.stopping());
+  std::string out =
+      wrapped(same ? "B would start to report " + starting + " and stop to report " + stopping + "."
+                   : "Of trace points that only B reported: " + starting +
+                         "; of those that only A reported: " + stopping + ".",
+              terminal.width, 2) +
+      "\n";
+  Table table({{same ? "CHANGE" : "REPORTED"},
+               {"OBJECTS", Table::Align::right},
+               {"TRACE POINT", Table::Align::left, true},
+               {same ? "HELD BACK BY" : "IN THE OTHER PERIOD", Table::Align::left, true}});
+  for (const auto& [change, count] : changes.listed()) {
+    std::string rule = change.why == kNotRecorded ? "not recorded" : change.why;
+    if (change.slot != 0) rule += " \"" + terminalText(change.value) + "\"";
+    const char* const words = same            ? (change.starts ? "starts" : "stops")
+                              : change.starts ? "only in B"
+                                              : "only in A";
+    table.add({{words, change.starts ? Colour::good : Colour::caution},
+               terminal.number(count),
+               pathText(change.subsystem, change.category, change.name),
+               rule});
+  }
+  if (!table.empty()) out += "\n" + table.render(terminal, 2);
+  if (changes.notListed() != 0)
+    out += "  " + objects(changes.notListed()) + " had further changes\n";
+  if (comparison.notCompared != 0)
+    out += "  " + objects(comparison.notCompared) + " of further trace points not compared\n";
+  return out;
+}
+
+std::string comparisonText(const Comparison& comparison, const std::string& heading, bool same,
                            const Terminal& terminal) {
   Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
   for (const auto verdict : kVerdictOrder) {
     sums.add({std::string(verdictName(verdict)), terminal.number(comparison.sides[0][verdict]),
               terminal.number(comparison.sides[1][verdict])});
   }
-  Table table({{"CHANGE"},
-               {"OBJECTS", Table::Align::right},
-               {"TRACE POINT", Table::Align::left, true},
-               {"RULE OF THE OTHER SIDE", Table::Align::left, true}});
-  for (const auto& [change, count] : comparison.changes.listed()) {
-    std::string rule = change.why;
-    if (change.slot != 0) rule += " \"" + terminalText(change.value) + "\"";
-    table.add({{change.starts ? "starts" : "stops", change.starts ? Colour::good : Colour::caution},
-               terminal.number(count),
-               terminalText(change.subsystem) + " / " + terminalText(change.category) + " / " +
-                   terminalText(change.name),
-               rule});
-  }
   std::string out = heading + "\n" + sums.render(terminal, 2) + "\n" +
-                    wrapped("B would start to report " +
-                                counted(comparison.changes.starting(), "object", "objects") +
-                                " and stop to report " +
-                                counted(comparison.changes.stopping(), "object", "objects") + ".",
-                            terminal.width, 2) +
-                    "\n";
-  if (!table.empty()) out += "\n" + table.render(terminal, 2);
-  if (const uint64_t count = comparison.changes.notListed(); count != 0)
-    out += "  " + counted(count, "object", "objects") + " had further changes\n";
-  if (const uint64_t count = comparison.notCompared; count != 0)
-    out += "  " + counted(count, "object", "objects") + " of further trace points not compared\n";
-  out += periodsText(comparison, terminal);
+                    changesText(comparison, same, terminal) + periodsText(comparison, terminal);
   if (!comparison.losses.empty()) out += "\n" + lossText(comparison.losses, terminal);
   return out;
 }
@@ -184,7 +195,7 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   print(options.json ? comparisonJson(comparison)
                      : comparisonText(comparison,
                                       comparisonHeading(settings, options, surroundings.terminal),
-                                      surroundings.terminal));
+                                      samePeriod(settings), surroundings.terminal));
   flushOutput();
   return warnOfUnreadFiles(comparison.unread, reading->store);
 }

@@ -83,7 +83,7 @@ class PointFigures {
 
 // The verdict that held back most objects.
 std::string mainReason(const VerdictCounts& counts) {
-  if (sumOf(counts) == 0) return "not_recorded";
+  if (sumOf(counts) == 0) return kNotRecorded;
   // The first verdict is "reported", which is no reason. Among equal counts the first verdict wins,
   // so the answer does not depend on the order of the store.
   auto main = kVerdictOrder[1];

@@ -26,13 +26,16 @@ struct Setting {
   Period period;
 };
 
+// What stands in the place of a verdict where a period has no such trace point.
+inline constexpr char kNotRecorded[] = "not_recorded";
+
 // A trace point that one side reports and the other does not, with the reason of the other side.
 struct Change {
   bool starts = false;  // reported by the second side alone
   std::string subsystem;
   std::string category;
   std::string name;
-  std::string why;  // verdict of the other side; "not_recorded" if it met no such object
+  std::string why;  // verdict of the other side; kNotRecorded if it met no such object
   // The text that the whitelist held back: its slot, 1 or 2, and its value. 0 for another reason.
   uint8_t slot = 0;
   std::string value;

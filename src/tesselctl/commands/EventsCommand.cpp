@@ -12,6 +12,7 @@
 
 #include "platform/Text.h"
 #include "tesselctl/commands/Command.h"
+#include "tesselctl/judging/ObjectSelection.h"
 #include "tesselctl/reading/SpoolReader.h"
 #include "tesselctl/showing/EventOutput.h"
 
@@ -53,7 +54,7 @@ class RowSelection {
 
   bool wants(const SpoolRow& stored) const {
     const SpooledEvent& row = stored.event;
-    // Whoever asks for what was sent yesterday means the day on which it left the machine.
+    // Whoever asks for what was delivered yesterday means the day on which it left the machine.
     const Date date{std::chrono::microseconds{options_.sent ? stored.delivery->at : row.time}};
     // The end is not in the period, so two periods that touch never share a row.
     if (period_ && (date < period_->start || date >= period_->end)) return false;
@@ -82,12 +83,12 @@ class EventsRun {
 
   int list() {
     const SpoolReader::State state = spool_.open();
-    // A machine that has sent nothing has no spool. With --follow the user waits for just that.
+    // A machine that has reported nothing has no spool. With --follow the user waits for just that.
     if (state == SpoolReader::State::absent && options_.follow) {
-      printError("There is no spool yet: nothing was sent. Waiting for " +
+      printError("There is no spool yet: nothing was reported. Waiting for " +
                  terminalText(spool_.path()) + ".\n");
     } else if (state == SpoolReader::State::absent) {
-      return nothingSent();
+      return nothingReported();
     } else if (state != SpoolReader::State::open) {
       return complain(state);
     } else if (!show()) {
@@ -123,15 +124,16 @@ class EventsRun {
 
   // That no row is there is an answer, and no failure. Where the state directory is something else,
   // we do not know.
-  int nothingSent() const {
+  int nothingReported() const {
     std::error_code error;
     const auto kind = std::filesystem::status(stateDirectory_, error).type();
     if (kind != std::filesystem::file_type::directory &&
         kind != std::filesystem::file_type::not_found)
       return fail(kBad, stateDirectory_ + " is no directory; TESSEL_STATE_DIR names the state " +
                             "directory of the service");
-    printError("Nothing was sent, or TESSEL_STATE_DIR names another place: there is no spool at " +
-               terminalText(spool_.path()) + ".\n");
+    printError(
+        "Nothing was reported, or TESSEL_STATE_DIR names another place: there is no spool at " +
+        terminalText(spool_.path()) + ".\n");
     return kDone;
   }
 
@@ -146,7 +148,7 @@ class EventsRun {
     switch (state) {
       case SpoolReader::State::absent:
         return fail(kBad, "there is no spool at " + spool_.path() +
-                              ": nothing was sent, or TESSEL_STATE_DIR names another place");
+                              ": nothing was reported, or TESSEL_STATE_DIR names another place");
       case SpoolReader::State::noAccess:
         return fail(
             kNoAccess,
@@ -241,11 +243,12 @@ constexpr uint64_t kMostRows = 1'000'000;
 CommandText eventsText() {
   return {
       "events", "Show what the spool holds, newest last",
-      helpText("The spool is statora.db in the state directory: one row per event that the "
-               "service sent, in order. A row waits until a forwarder has delivered it. Then it "
-               "stays for 7 days, or less where room is needed, with the time and the "
-               "destination. On a terminal '~' stands for 'com.vantor.performance.'. Patterns "
-               "may hold *, ? and [...].") +
+      helpText(
+          "The spool is statora.db in the state directory: one row per event that the "
+          "service reported, in order. A row waits until a forwarder has delivered it. Then it "
+          "stays for 7 days, or less where room is needed, with the time and the "
+          "destination. On a terminal '~' stands for 'com.vantor.performance.'. Patterns "
+          "may hold *, ? and [...].") +
           helpText("Without a terminal a row is one line, with tabs between: id, time, name, "
                    "time of delivery, destination, payload as 'path key=value ...'. While a row "
                    "waits, time of delivery and destination are empty. How many rows wait and "
@@ -266,12 +269,12 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, eventsText(), runEvents);
   command
       .add_option("--since", options.period.since,
-                  "Only events sent since then: 2026-11-22, '2026-11-22 21:45 CET', 21:45, "
+                  "Only events reported since then: 2026-11-22, '2026-11-22 21:45 CET', 21:45, "
                   "yesterday, monday, -24h, '2 hours ago'")
       ->type_name("DATE");
   command
       .add_option("--until", options.period.until,
-                  "Only events sent before then, in the same forms")
+                  "Only events reported before then, in the same forms")
       ->type_name("DATE");
   command
       .add_option("--last", options.period.last, "Only events of this length of time: 30m, 24h, 7d")
@@ -288,7 +291,7 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
       "--sent", options.sent,
       "Only what was delivered; --since, --until and --last then mean the time of delivery");
   command.add_flag("--waiting", options.waiting, "Only what waits for delivery")->excludes(sent);
-  command.add_flag("--follow", options.follow, "Go on with what is sent from now on");
+  command.add_flag("--follow", options.follow, "Go on with what is reported from now on");
   command.add_flag("--json", options.json,
                    "One JSON object a line: id, time, name, state, payload");
   CLI::App* show = command.add_subcommand("show", "Show one row whole, its payload laid out");

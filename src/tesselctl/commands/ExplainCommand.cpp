@@ -13,8 +13,11 @@
 #include "platform/Text.h"
 #include "service/ObjectReporter.h"
 #include "tesselctl/commands/Command.h"
+#include "tesselctl/judging/ObjectSelection.h"
 #include "tesselctl/judging/Tally.h"
+#include "tesselctl/judging/Tasking.h"
 #include "tesselctl/showing/ExplanationOutput.h"
+#include "tesselctl/showing/Losses.h"
 #include "tesselctl/showing/SummaryOutput.h"
 
 namespace tessel::ctl {
@@ -23,35 +26,19 @@ namespace {
 
 struct ExplainOptions {
   ReadingOptions reading;
-  std::vector<std::string> subsystems;
-  std::vector<std::string> categories;
-  std::vector<std::string> names;
-  std::vector<std::string> verdicts;
+  ObjectPatterns patterns;
   bool payload = false;
   bool summary = false;
   bool follow = false;
   bool json = false;
 };
 
-// Whether the options choose an object. A million objects may pass here, so a text is copied for
-// the pattern matcher only where there is a pattern.
-bool chosen(const ExplainOptions& options, const TesselObject& object,
-            TesselReporterClassification verdict) {
-  const auto fits = [](const std::vector<std::string>& patterns, std::string_view text) {
-    return patterns.empty() || fitsOne(patterns, std::string(text));
-  };
-  return fits(options.subsystems, object.subsystem().textOr("")) &&
-         fits(options.categories, object.category().textOr("")) &&
-         fits(options.names, object.name().textOr("")) &&
-         fits(options.verdicts, verdictName(verdict));
-}
-
 // Builds the payload with the code and the facts of a run, identities of processes included.
 class PayloadBuilder {
  public:
   PayloadBuilder() : identity_(bundles_), bootVolume_(bootVolumeFacts(volumes_)) {}
 
-  // Empty if a run would send nothing for the object.
+  // Empty if a run would report nothing for the object.
   std::string json(const TesselObject& object) {
     const std::optional<Payload> payload = reportPayload(object, identity_, bootVolume_);
     return payload ? payloadJson(*payload, {.forTerminal = true}) : "";
@@ -70,6 +57,8 @@ class ExplainRun {
              const Surroundings& surroundings)
       : options_(options),
         reading_(reading),
+        launch_(surroundings.launch),
+        selection_(options.patterns),
         judge_(reading.machine),
         tally_(reading.period),
         terminal_(surroundings.terminal),
@@ -87,7 +76,7 @@ class ExplainRun {
  private:
   void inspect(const TesselObject& object, const EntryHeader& entry) {
     const FilterDecision decision = judge_.inspect(object);
-    if (!chosen(options_, object, decision.classification)) return;
+    if (!selection_.chooses(object, decision.classification)) return;
     tally_.count(object, decision, entry);
     if (options_.summary) return;
     const Explanation explanation{
@@ -127,7 +116,73 @@ class ExplainRun {
       print(closingLine());
     }
     flushOutput();
+    if (!options_.json) tellWhatIsNotThere();
     return warnOfUnreadFiles(run_.report().store, reading_.store);
+  }
+
+  // The rows show what became an object. Whoever misses a point wants to know the rest, too. It
+  // goes to standard error, so that a pipe gets rows alone.
+  void tellWhatIsNotThere() {
+    const auto say = [&](const std::string& line) {
+      printError(wrapped(line, terminal_.width, 2) + "\n");
+    };
+    const std::string begins = openBegins();  // their names are among those that come near
+    if (tally_.traceObjects() == 0) {
+      for (const std::string& line : whyNothing()) say(line);
+    }
+    if (!begins.empty()) say(begins);
+    if (!options_.summary) {
+      const ExtractionReport report = run_.report();
+      Losses lost;
+      for (const Loss& loss : report.store.reading.losses.all()) {
+        // warnOfUnreadFiles() names the damage of a stream.
+        if (loss.code != LossCode::fileDamaged || reading_.store != kStandardInput) lost.add(loss);
+      }
+      for (const std::string& loss : lossLines(lost, 1)) say("Lost: " + terminalText(loss));
+    }
+    // A store that the command line names may be a copy from elsewhere.
+    const Tasking tasking = askTasking(launch_);
+    if (!options_.reading.store && !tasking.decision.on() &&
+        tasking.decision.source() != TaskingSource::unknown &&
+        tally_.verdicts()[TesselReporterClassificationTelemetryReported] != 0) {
+      say("Reporting is off on this machine: " + terminalText(taskingWords(tasking, launch_)) +
+          ". 'reported' tells what a run would report if it were on.");
+    }
+  }
+
+  std::vector<std::string> whyNothing() const {
+    const ExtractionReport report = run_.report();
+    const std::string store = reading_.store.value_or("the journal of this machine");
+    std::vector<std::string> lines = {
+        (report.delivered == 0 ? "No trace object: " : "No trace object fits: ") +
+        counted(report.entriesRead, "log event", "log events") +
+        (report.delivered == 0
+             ? ""
+             : " with " + counted(report.delivered, "trace object", "trace objects")) +
+        " looked at, in " +
+        terminalText(store == kStandardInput ? kStandardInputName : std::string_view(store)) +
+        ", " + periodText(reading_.period)};
+    for (const std::string& line : selection_.whyNone()) lines.push_back(terminalText(line));
+    return lines;
+  }
+
+  // The begins among them that the patterns choose, with the first few of their names.
+  std::string openBegins() {
+    constexpr size_t kNamed = 5;
+    std::vector<std::string> names;
+    uint64_t begins = 0;
+    run_.forEachOpen([&](StringRef subsystem, StringRef category, StringRef name) {
+      if (!selection_.choosesBegin(subsystem, category, name)) return;
+      ++begins;
+      const std::string path = pathText(subsystem.textOr(""), category.textOr(""), name.textOr(""));
+      if (names.size() < kNamed && std::ranges::find(names, path) == names.end())
+        names.push_back(path);
+    });
+    if (begins == 0) return "";
+    std::string words = counted(begins, "begin waits for its end", "begins wait for their ends") +
+                        ", and " + (begins == 1 ? "is" : "are") + " no trace object before: ";
+    for (const std::string& name : names) words += (&name == names.data() ? "" : ", ") + name;
+    return words + (begins > names.size() ? ", ..." : "");
   }
 
   std::string closingLine() const {
@@ -148,6 +203,8 @@ class ExplainRun {
 
   const ExplainOptions& options_;
   const Reading& reading_;
+  const LaunchConfiguration& launch_;
+  ObjectSelection selection_;
   Judge judge_;
   Tally tally_;
   const Terminal& terminal_;
@@ -178,7 +235,7 @@ int runExplain(const ExplainOptions& options, const Surroundings& surroundings) 
 std::string meaningOf(TesselReporterClassification verdict) {
   switch (verdict) {
     case TesselReporterClassificationTelemetryReported:
-      return "it would be sent";
+      return "it would be reported";
     case TesselReporterClassificationTelemetryDisabled:
       return "it is not marked for telemetry (TESSEL_TELEMETRY=1)";
     case TesselReporterClassificationFailedStringWhitelist:
@@ -186,7 +243,7 @@ std::string meaningOf(TesselReporterClassification verdict) {
     case TesselReporterClassificationDurationThreshold:
       return "its duration is negative";
     case TesselReporterClassificationFailedSCFilter:
-      return "only one in so many of these is sent; 'tesselctl rules' shows the rows";
+      return "only one in so many of these is reported; 'tesselctl rules' shows the rows";
     case TesselReporterClassificationClassNotSupported:
       return "its kind cannot be reported";
   }
@@ -197,23 +254,26 @@ CommandText explainText() {
   std::vector<HelpRow> verdicts;
   for (const auto verdict : kVerdictOrder)
     verdicts.push_back({std::string(verdictName(verdict)), meaningOf(verdict)});
-  return {"explain", "Say what becomes of each recorded trace point, and why",
-          helpText("Nothing is sent, and neither run marker nor spool is touched. Downsampling "
-                   "begins at zero, as in a service that has just started. Without a period the "
-                   "last 24 hours are read, as in a run. Patterns may hold *, ? and [...]. Members "
-                   "of the group systemd-journal may read the journal.") +
-              helpTable("Verdicts", verdicts) +
-              helpText("Without a terminal a trace point is one line, with tabs between: time, "
-                       "verdict, kind (event, interval, animation), subsystem, category, name, "
-                       "reason, duration in seconds, frames per second, name of the process, its "
-                       "id, its user; with --payload the payload. What is not known is empty.") +
-              helpEnvironment({"TESSEL_TRACE_STORE", "TESSEL_OS_RELEASE", "TZ"}) +
-              "Examples:\n"
-              "  tesselctl explain --last 1h --subsystem 'com.vantor.*' \\\n"
-              "    --verdict string_whitelist\n"
-              "  tesselctl explain --follow\n"
-              "  tesselctl explain --summary\n"
-              "  tesselctl explain --last 7d | cut -f 2 | sort | uniq -c"};
+  return {
+      "explain", "Say what becomes of each recorded trace point, and why",
+      helpText("Nothing is reported, and neither run marker nor spool is touched. Downsampling "
+               "begins at zero, as in a service that has just started. Without a period the "
+               "last 24 hours are read, as in a run. Patterns may hold *, ? and [...]. Members "
+               "of the group systemd-journal may read the journal.") +
+          helpTable("Verdicts", verdicts) +
+          helpText("Without a terminal a trace point is one line, with tabs between: time, "
+                   "verdict, kind (event, interval, animation), subsystem, category, name, "
+                   "reason, duration in seconds, frames per second, name of the process, its "
+                   "id, its user; with --payload the payload. What is not known is empty. Standard "
+                   "error tells of trace points in no row: begins that wait for their ends, "
+                   "and losses.") +
+          helpEnvironment({"TESSEL_TRACE_STORE", "TESSEL_OS_RELEASE", "TZ"}) +
+          "Examples:\n"
+          "  tesselctl explain --last 1h --subsystem 'com.vantor.*' \\\n"
+          "    --verdict string_whitelist\n"
+          "  tesselctl explain --follow\n"
+          "  tesselctl explain --summary\n"
+          "  tesselctl explain --last 7d | cut -f 2 | sort | uniq -c"};
 }
 
 std::vector<std::string> verdictWords() {
@@ -228,16 +288,17 @@ void addExplainCommand(CLI::App& app, Invocation& invocation) {
   const auto [command, options] = addCommand(app, invocation, explainText(), runExplain);
   addPeriodOptions(command, options.reading);
   addJudgeOptions(command, options.reading);
-  addPatterns(command, "--subsystem", options.subsystems,
+  addPatterns(command, "--subsystem", options.patterns.subsystems,
               "Only trace points of this subsystem; may be repeated");
-  addPatterns(command, "--category", options.categories, "Only of this category; may be repeated");
-  addPatterns(command, "--name", options.names, "Only of this name; may be repeated");
-  takesOneOf(addPatterns(command, "--verdict", options.verdicts,
+  addPatterns(command, "--category", options.patterns.categories,
+              "Only of this category; may be repeated");
+  addPatterns(command, "--name", options.patterns.names, "Only of this name; may be repeated");
+  takesOneOf(addPatterns(command, "--verdict", options.patterns.verdicts,
                          "Only with this verdict; may be repeated"),
              verdictWords())
       ->type_name("VERDICT");
   auto* const payload =
-      command.add_flag("--payload", options.payload, "Show the payload of what would be sent");
+      command.add_flag("--payload", options.payload, "Show the payload of what would be reported");
   command.add_flag("--summary", options.summary, "Show figures instead of trace points")
       ->excludes(payload);
   command.add_flag("--follow", options.follow, "Go on with what is recorded from now on");

@@ -164,24 +164,24 @@ int runRules(const RulesOptions& options, const Surroundings& surroundings) {
 }
 
 CommandText rulesText() {
-  return {
-      "rules", "Show which words may be written, and check one",
-      helpText("A labelled string is sent only if its value stands on a list of the platform. A "
-               "build with internal diagnostics asks no list. A downsampling row lets one in "
-               "'ratio' of its trace points through, and 'cap' at most.") +
-          helpTable(
-              "Without a terminal a record is one line, with tabs between",
-              {{"platform", "NAME, 'this' or 'other', values known, downsampling rows"},
-               {"value", "PLATFORM, list, value"},
-               {"special",
-                "PLATFORM, subsystem, category, name, list of string 1, list "
-                "of string 2"},
-               {"downsampling", "PLATFORM, subsystem, category, name (* for any), cap, ratio"}}) +
-          helpEnvironment({"TESSEL_OS_RELEASE"}) +
-          "Examples:\n"
-          "  tesselctl rules | grep -i week\n"
-          "  tesselctl rules check week\n"
-          "  tesselctl rules check com.vantor.Calendar View Open --string1 period=week"};
+  return {"rules", "Show which words may be written, and check one",
+          helpText(
+              "A labelled string is reported only if its value stands on a list of the platform. A "
+              "build with internal diagnostics asks no list. A downsampling row lets one in "
+              "'ratio' of its trace points through, and 'cap' at most.") +
+              helpTable("Without a terminal a record is one line, with tabs between",
+                        {{"platform", "NAME, 'this' or 'other', values known, downsampling rows"},
+                         {"value", "PLATFORM, list, value"},
+                         {"special",
+                          "PLATFORM, subsystem, category, name, list of string 1, list "
+                          "of string 2"},
+                         {"downsampling",
+                          "PLATFORM, subsystem, category, name (* for any), cap, ratio"}}) +
+              helpEnvironment({"TESSEL_OS_RELEASE"}) +
+              "Examples:\n"
+              "  tesselctl rules | grep -i week\n"
+              "  tesselctl rules check week\n"
+              "  tesselctl rules check com.vantor.Calendar View Open --string1 period=week"};
 }
 
 }  // namespace

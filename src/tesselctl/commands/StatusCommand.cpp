@@ -234,7 +234,7 @@ constexpr const char* kMeanings[] = {
     "the service's user cannot write the record of a run",
     "the run marker is not the service's own, or could not be removed",
     "runs are put off for a day",
-    "the last run could not read files of the trace store",
+    "the trace store cannot be opened, or the last run could not read files of it",
     "the last run met damage in the trace store",
     "the spool cannot be read as what it is",
     "rows wait, and the forwarder has delivered none for two hours",
@@ -242,15 +242,16 @@ constexpr const char* kMeanings[] = {
     "the last run failed",
     "two of the last four runs died, or read nothing because one had died",
     "the spool refused rows of the last run",
-    "since the last run rows went unsent because of their age",
+    "since the last run rows left the spool undelivered because of their age",
     "the sums of the last run do not agree",
     "reporting is on, and no run has read its day for 36 hours",
+    "reporting is on, and the timer of the package is not active",
     "a deferral or the limit on its time ended the last run early",
     "programs recorded trace points that the journal did not take",
     "the journal daemon dropped entries",
     "a writer had more than his share",
     "entries miss a field of a trace point, or hold a bad one",
-    "entries are in no file of the store, vacuumed or lost",
+    "entries are in no file of the store: vacuumed, not exported or lost",
     "the store reaches back less than a day",
     "a damaged spool was set aside",
 };
@@ -263,18 +264,19 @@ CommandText statusText() {
     const auto code = static_cast<FindingCode>(at);
     (isProblem(code) ? problems : notes).push_back({std::string(findingName(code)), kMeanings[at]});
   }
-  return {
-      "status", "Say whether this machine reports, and whether all is well",
-      helpText("Exit status 0 if there is no problem, 1 if there is one, 4 if this user may not "
-               "look. A problem concerns the state now or the last run, and goes by itself once "
-               "the state is well. It comes with advice and a command.") +
-          helpTable("Problems", problems) +
-          helpTable("Notes, which leave the exit status alone", notes) +
-          helpEnvironment({"TESSEL_STATE_DIR", "TESSEL_CONFIG_DIR", "TESSEL_TRACE_STORE",
-                           "TESSEL_OS_RELEASE", "TESSEL_DEFER_ON", "TESSEL_ACTIVITY_INTERVAL",
-                           "TESSEL_SPOOL_LIMIT", "TZ"}) +
-          "Example: warn from a cron job\n"
-          "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root"};
+  return {"status", "Say whether this machine reports, and whether all is well",
+          helpText(
+              "Exit status 0 if there is no problem, 1 if there is one, 4 if this user may not "
+              "look. A problem concerns the state now or the last run, and goes by itself once "
+              "the state is well. It comes with advice and a command. Without a problem the last "
+              "line says good; off, where reporting is off; or idle, where nothing starts a run.") +
+              helpTable("Problems", problems) +
+              helpTable("Notes, which leave the exit status alone", notes) +
+              helpEnvironment({"TESSEL_STATE_DIR", "TESSEL_CONFIG_DIR", "TESSEL_TRACE_STORE",
+                               "TESSEL_OS_RELEASE", "TESSEL_DEFER_ON", "TESSEL_ACTIVITY_INTERVAL",
+                               "TESSEL_SPOOL_LIMIT", "TZ"}) +
+              "Example: warn from a cron job\n"
+              "  tesselctl status >/dev/null || tesselctl status | mail -s tessel root"};
 }
 
 }  // namespace

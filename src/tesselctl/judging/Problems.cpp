@@ -13,7 +13,6 @@
 // that is switched off every night would never be up for a day and a half.
 
 #include <algorithm>
-#include <array>
 #include <set>
 
 #include "platform/Text.h"
@@ -45,20 +44,6 @@ constexpr hours kLongestOrder{2};
 // Clocks are corrected by small steps all the time. Less than this is no setting of the clock.
 constexpr std::chrono::minutes kClockTolerance{1};
 
-// What may have caused what, most direct first. A cause counts only where it is found, too.
-constexpr struct {
-  FindingCode effect;
-  std::array<FindingCode, 6> causes;  // filled up with noAccess, which causes nothing
-} kCauses[] = {
-    {FindingCode::forwarderStuck, {FindingCode::spoolDamaged}},
-    {FindingCode::spoolFilling, {FindingCode::forwarderStuck}},
-    {FindingCode::bailedOut, {FindingCode::markerStuck}},
-    {FindingCode::rowsExpired, {FindingCode::forwarderStuck}},
-    {FindingCode::noCompletedRun,
-     {FindingCode::deferred, FindingCode::taskingUnreadable, FindingCode::runFailed,
-      FindingCode::bailedOut, FindingCode::markerStuck, FindingCode::recordUnwritable}},
-};
-
 class StatusJudge {
  public:
   explicit StatusJudge(ReporterStatus& status) : status_(status) {
@@ -72,13 +57,14 @@ class StatusJudge {
   void judge() {
     if (status_.run) addRun(*status_.run);
     lookAtAccess();
+    lookAtStore();
     lookAtMarkers();
     lookAtDeferral();
     lookAtSpool();
     lookAtForwarder();
     lookAtDeadRuns();
     lookForRuns();
-    nameCauses();
+    nameCauses(status_);
     for (Finding& each : status_.findings) {
       each.command = onThisDirectory(each.command);
       each.since = std::min(each.since, status_.now);
@@ -94,10 +80,6 @@ class StatusJudge {
  private:
   Finding& add(FindingCode code, std::string words, Date since) {
     return status_.findings.emplace_back(finding(code, std::move(words), since));
-  }
-  bool found(FindingCode code) const {
-    return std::any_of(status_.findings.begin(), status_.findings.end(),
-                       [&](const Finding& each) { return each.code == code; });
   }
   void cannotLookAt(std::initializer_list<FindingCode> codes) { notLookedAt_.insert(codes); }
 
@@ -123,6 +105,9 @@ class StatusJudge {
 
   void addRun(const RunRecord& run) {
     for (Finding& each : findingsOf(run)) {
+      // What failed in an earlier run is over once a later one came to its end. Rows that expired
+      // count until the next run, whatever that run does.
+      if (status_.lastRunWasUntasked() && each.code != FindingCode::rowsExpired) continue;
       // These need more than the run, and are judged below.
       if (each.code == FindingCode::markerStuck || each.code == FindingCode::bailedOut) continue;
       // Without a forwarder rows expire because nobody wants them.
@@ -182,6 +167,20 @@ class StatusJudge {
       add(noAccess, "This user may not read the trace store: " + status_.journal.failure->words,
           status_.now);
     }
+  }
+
+  // A run that began now would fail, whether or not one is to begin. Without access we know nothing
+  // about the store: see lookAtAccess().
+  void lookAtStore() {
+    const auto& failure = status_.journal.failure;
+    if (!failure || failure->code == ErrorCode::noAccess) return;
+    Finding& unreadable = add(FindingCode::storeUnreadable,
+                              "The trace store cannot be read: " + failure->words, status_.now);
+    unreadable.advice =
+        "See whether the journal daemon runs, and whether TESSEL_TRACE_STORE names a store. A run "
+        "fails without one.";
+    unreadable.command = "ls -ld " + (status_.store ? shellWord(*status_.store)
+                                                    : "/var/log/journal/* /run/log/journal/*");
   }
 
   // Whether the last run that has no end came to one all the same: the scheduler notes a run only
@@ -266,7 +265,8 @@ class StatusJudge {
       words += "the last error" + (ago ? ", " + durationText(*ago) + " ago" : std::string()) +
                ": " + shortPlainText(forwarder->lastError, kMaxErrorBytes);
     } else {
-      words += "it has told no error since, so it may not be running";
+      words +=
+          "it has told no error since, so it does not run, or its own settings make it wait longer";
     }
     add(FindingCode::forwarderStuck, std::move(words), *since);
   }
@@ -277,7 +277,7 @@ class StatusJudge {
     std::vector<RunNote> runs = status_.runs;
     if (status_.underWay && !runs.empty() && !runs.back().end) runs.pop_back();
     if (endIsMissing()) runs.pop_back();
-    if (runs.empty() || runs.back().reported()) return;
+    if (runs.empty() || runs.back().reported() || status_.lastRunWasUntasked()) return;
     const auto isBad = [](const RunNote& note) {
       return !note.outcome || *note.outcome == RunOutcome::bailedOut;
     };
@@ -312,7 +312,13 @@ class StatusJudge {
   }
 
   void lookForRuns() {
-    if (!status_.tasking.decision.on() || status_.boot.upFor < kGraceAfterBoot) return;
+    if (!status_.tasking.decision.on()) return;
+    const bool idle = status_.nextRun.timerInactive;
+    if (idle) {
+      add(FindingCode::nothingStartsRuns,
+          "tessel-reporter.timer is not active, so no run begins by itself", status_.now);
+    }
+    if (status_.boot.upFor < kGraceAfterBoot) return;
     const auto last = std::find_if(status_.runs.rbegin(), status_.runs.rend(),
                                    [](const RunNote& note) { return note.reported(); });
     std::optional<Date> since = taskedSince();
@@ -323,7 +329,8 @@ class StatusJudge {
     if (!since || status_.now - *since <= kLongestWithoutRun) return;
     add(FindingCode::noCompletedRun,
         "No run has reported for " + durationText(status_.now - *since) +
-            (ran ? "" : ", none since reporting is on"),
+            (ran ? "" : ", none since reporting is on") +
+            (idle ? ", and tessel-reporter.timer is not active" : ""),
         *since);
   }
 
@@ -339,36 +346,6 @@ class StatusJudge {
       at += whole ? own.size() : kPackages.size();
     }
     return command;
-  }
-
-  void nameCauses() {
-    for (Finding& each : status_.findings) {
-      if (each.code == FindingCode::rowsRefused) each.because = causeOfRefusal(each.words);
-      if (each.code == FindingCode::runFailed) each.because = causeOfFailure();
-      for (const auto& row : kCauses) {
-        if (row.effect != each.code) continue;
-        const auto cause = std::find_if(
-            row.causes.begin(), row.causes.end(),
-            [&](FindingCode code) { return code != FindingCode::noAccess && found(code); });
-        if (cause != row.causes.end()) each.because = *cause;
-      }
-    }
-  }
-  std::optional<FindingCode> causeOfRefusal(const std::string& words) const {
-    if (words.ends_with("reason limit") && found(FindingCode::spoolFilling))
-      return FindingCode::spoolFilling;
-    if (words.ends_with("reason damaged") && found(FindingCode::spoolDamaged))
-      return FindingCode::spoolDamaged;
-    return {};
-  }
-  // The run says in words why it failed. These two begin with words of service/ReportingRun.cpp.
-  std::optional<FindingCode> causeOfFailure() const {
-    if (status_.run->failure.starts_with("the run marker") && found(FindingCode::markerStuck))
-      return FindingCode::markerStuck;
-    if (status_.run->failure.starts_with("the tasking configuration") &&
-        found(FindingCode::taskingUnreadable))
-      return FindingCode::taskingUnreadable;
-    return {};
   }
 
   ReporterStatus& status_;

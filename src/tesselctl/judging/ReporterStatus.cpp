@@ -79,12 +79,16 @@ JournalFacts lookAtJournal(const std::optional<std::string>& store) {
     return facts;
   }
   auto& trace = *std::get<std::unique_ptr<JournalStore>>(opened);
-  // Headers of closed journals tell their oldest entry. An export file has no header: it shows its
-  // oldest entry only once it is read.
+  // Headers of closed journals tell their oldest entry. An export file has no header, and to read
+  // gigabytes for one line of the screen would take minutes. So of such a file we know the first
+  // entry.
   trace.entries().next();
-  if (const auto oldest = trace.report().reading.oldestEntry) {
+  const StoreReport report = trace.report();
+  if (const auto oldest = report.reading.oldestEntry) {
     facts.oldest = Date{std::chrono::microseconds{static_cast<int64_t>(*oldest)}};
   }
+  facts.mayBeOlder = std::any_of(report.files.begin(), report.files.end(),
+                                 [](const auto& file) { return file.path.ends_with(".export"); });
   return facts;
 }
 
@@ -175,6 +179,16 @@ std::optional<std::string> refusalOf(const std::string& directory) {
   return fileError("state directory " + directory, EACCES).words;
 }
 
+std::vector<std::string> variablesOfThisProcess() {
+  std::vector<std::string> names;
+  for (char** each = environ; *each != nullptr; ++each) {
+    const std::string_view pair = *each;
+    if (pair.starts_with("TESSEL_")) names.emplace_back(pair.substr(0, pair.find('=')));
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
 NextRun nextRunOf(const ReporterStatus& status, const LaunchConfiguration& launch) {
   if (status.underWay) return {NextRun::By::underWay, {}};
   const auto interval =
@@ -218,6 +232,7 @@ ReporterStatus gatherStatus(const LaunchConfiguration& launch, Date now) {
   ReporterStatus status;
   status.now = now;
   status.boot = thisBoot();
+  status.variables = variablesOfThisProcess();
   status.stateDirectory = launch.stateDirectory;
   status.ofPackage = launch.stateDirectory == kPackageStateDirectory;
   status.stateRefused = refusalOf(launch.stateDirectory);

@@ -45,7 +45,10 @@ struct Marker {
 std::string_view markerStateName(Marker::State state);
 
 struct JournalFacts {
-  std::optional<Date> oldest;            // entry; absent where the store has none
+  std::optional<Date> oldest;  // entry; absent where the store has none
+  // Whether an older entry may stand further on. Only a whole reading of an export file would tell,
+  // since its entries may stand in any order.
+  bool mayBeOlder = false;
   std::optional<PlatformError> failure;  // absent where it can be read
 };
 
@@ -71,6 +74,8 @@ struct ServiceAccess {
 struct ReporterStatus {
   Date now{};
   Boot boot;
+  // The variables named TESSEL_... that this process was started with. The units may have others.
+  std::vector<std::string> variables;
   std::string stateDirectory;
   bool ofPackage = false;                   // it is the one that the package's unit uses
   std::optional<std::string> stateRefused;  // why this user may not look into it
@@ -101,7 +106,7 @@ struct ReporterStatus {
   std::vector<Finding> findings;
   std::vector<FindingCode> checked;  // the problems that were looked for
 
-  // Whether the last run sent anything: only then are there sums that must balance.
+  // Whether the last run reported anything: only then are there sums that must balance.
   bool hasBooks() const { return run && run->hasBooks(); }
   bool good() const { return findings.empty() || !isProblem(findings.front().code); }
   // Whether the journal reaches back as far as a run looks.
@@ -112,6 +117,12 @@ struct ReporterStatus {
   // so that a spool with rows in it does not seem to be empty.
   uint64_t spoolPercent() const {
     return spool.bytesOfWaiting == 0 ? 0 : spool.bytesOfWaiting / (spoolLimitBytes / 100 + 1) + 1;
+  }
+  // Whether the last run had nothing to do: reporting is off, and a run later than the noted ones
+  // came to its end.
+  bool lastRunWasUntasked() const {
+    return !tasking.decision.on() && lastBegin &&
+           (runs.empty() || *lastBegin > runs.back().start) && (!run || *lastBegin > run->start);
   }
   // Whether the last run that began has no end, and is not under way.
   bool lastRunDied() const { return !underWay && !runs.empty() && !runs.back().end; }
@@ -124,6 +135,9 @@ struct ReporterStatus {
            (!recordWritten || *recordWritten < *lastBegin);
   }
 };
+
+// Names for each finding the one that it follows from, where that one was found, too.
+void nameCauses(ReporterStatus& status);
 
 // Fills `findings` and `checked` from the facts.
 void judge(ReporterStatus& status);

@@ -1,7 +1,7 @@
 // DryRun: what a run of the service would make of a trace store, without a run.
 //
 // The parts of the service read the store and assemble the trace objects. The visitor judges and
-// counts them. Nothing is sent. The run marker and the spool stay as they are.
+// counts them. Nothing is reported. The run marker and the spool stay as they are.
 //
 // Memory has the bounds of a run. Threads: one at a time.
 
@@ -47,6 +47,10 @@ class DryRun {
   // The process that wrote the entry which the visitor was given. REQUIRES: the visitor is running.
   EntryProcess currentProcess() const { return extractor_.currentProcess(); }
 
+  // The begins that wait for their end. They make no object before.
+  void forEachOpen(const IntervalAssembler::OpenVisitor& visit) const {
+    extractor_.forEachOpen(visit);
+  }
   // The findings so far. Its facts about the store are those of the last reading.
   ExtractionReport report() const { return extractor_.report(storeReport_); }
 

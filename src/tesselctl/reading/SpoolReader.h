@@ -28,9 +28,10 @@ struct SpoolContents {
   // Of the database, what new rows cannot have. Delivered rows and free pages give way to them, so
   // these do not count.
   uint64_t bytesOfWaiting = 0;
-  std::optional<uint64_t> limit;  // the service's TESSEL_SPOOL_LIMIT; absent until a run has sent
-  int64_t delivered = 0;          // rows that a collector took and that are still here
-  int64_t setAside = 0;           // rows that a collector refused
+  std::optional<uint64_t>
+      limit;              // the service's TESSEL_SPOOL_LIMIT; absent until a run has reported
+  int64_t delivered = 0;  // rows that a collector took and that are still here
+  int64_t setAside = 0;   // rows that a collector refused
   std::optional<ForwarderCounters> forwarder;  // absent where none ever worked on it
 };
 

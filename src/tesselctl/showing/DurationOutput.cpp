@@ -83,7 +83,11 @@ std::string shownValue(const Style& style, float value, const Terminal& terminal
 
 std::string heading(const Style& style, const Terminal& terminal) {
   const std::string unit = terminal.interactive ? "" : std::string(" in ") + style.unit;
-  return "\n" + terminal.paint(Colour::strong, style.title + unit + ", within 1.6 %") + "\n";
+  // QuantileSketch::kError. What people read is a rule for their eyes: a difference below it means
+  // nothing.
+  static_assert(QuantileSketch::kError < 0.016);
+  return "\n" + terminal.paint(Colour::strong, style.title + unit) +
+         ": a percentile may be off by 1.6 % of its value, the rest is exact\n";
 }
 
 std::string upper(std::string text) {
@@ -93,10 +97,7 @@ std::string upper(std::string text) {
 
 // Of a row or a change.
 std::string shownPath(const auto& point) {
-  std::string path = terminalText(point.subsystem.textOr("-")) + " / ";
-  path += terminalText(point.category.textOr("-"));
-  if (point.name) path += " / " + terminalText(point.name.text());
-  return path;
+  return pathText(point.subsystem.textOr(""), point.category.textOr(""), point.name.textOr(""));
 }
 
 // Each row has the same keys, as tools that make tables want it. So an absent text is empty.

@@ -107,7 +107,7 @@ std::string rowFields(const SpoolRow& row, const Terminal& terminal) {
 }
 
 constexpr size_t kIdWidth = 6;
-constexpr size_t kEventWidth = 24;
+constexpr size_t kEventWidth = 22;
 
 std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
   const SpooledEvent& event = row.event;
@@ -116,7 +116,7 @@ std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
   const std::string time = dateText(dateOf(event.time)).substr(5);
   std::string id = idText(event);
   id.insert(0, kIdWidth - std::min(kIdWidth, id.size()), ' ');
-  const std::string state = row.delivery ? "sent " : "waits";
+  const std::string state = row.delivery ? "delivered" : "waits    ";
   // The payload gets the rest of the line, and one column at least on a narrow terminal.
   const size_t used = id.size() + 2 + time.size() + 2 + state.size() + 2 + kEventWidth + 2;
   const std::string payload = cutOff(glance(parsed(event.payload), event.payload),
@@ -161,14 +161,14 @@ std::string wholeEvent(const SpoolRow& row, const Terminal& terminal) {
   const auto line = [&](std::string_view label, const std::string& text) {
     return terminal.paint(Colour::faint, label) + terminalText(text) + "\n";
   };
-  std::string out = line("Id       ", idText(event)) +
-                    line("Time     ", stampText(dateOf(event.time))) +
-                    line("Name     ", event.name);
+  std::string out = line("Id         ", idText(event)) +
+                    line("Time       ", stampText(dateOf(event.time))) +
+                    line("Name       ", event.name);
   if (row.delivery) {
-    out +=
-        line("Sent     ", stampText(dateOf(row.delivery->at)) + " to " + row.delivery->destination);
+    out += line("Delivered  ",
+                stampText(dateOf(row.delivery->at)) + " to " + row.delivery->destination);
   }
-  if (!Json::accept(event.payload)) return out + line("No JSON  ", event.payload);
+  if (!Json::accept(event.payload)) return out + line("No JSON    ", event.payload);
   std::string escaped;
   JsonWriter(escaped, {.forTerminal = true}).raw(replaceInvalidUtf8(event.payload));
   return out + laidOut(escaped) + "\n";
@@ -183,7 +183,7 @@ std::string eventTotals(const SpoolContents& contents, const std::vector<Deliver
     return counted(static_cast<uint64_t>(count), "row", "rows");
   };
   std::string out = rows(contents.rows) + (contents.rows == 1 ? " waits" : " wait") + ", " +
-                    rows(contents.delivered) + " sent and still here\n";
+                    rows(contents.delivered) + " delivered and still here\n";
   for (const Delivered& one : deliveries) {
     out += rows(one.rows) + " to " + terminalText(one.destination) + ", the last at " +
            zonedText(dateOf(one.last)) + "\n";

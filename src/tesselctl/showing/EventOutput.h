@@ -23,7 +23,7 @@ EventPath pathOf(const SpooledEvent& row);
 std::string eventJson(const SpoolRow& row);
 // One line: as wide as the terminal, or fields with tabs between.
 std::string eventLine(const SpoolRow& row, const Terminal& terminal);
-// The line above the rows of a terminal: when the first of them was sent, with year and zone.
+// The line above the rows of a terminal: when the first of them was reported, with year and zone.
 std::string eventHeading(const SpoolRow& first, const Terminal& terminal);
 // All of the row, its payload laid out on many lines.
 std::string wholeEvent(const SpoolRow& row, const Terminal& terminal);

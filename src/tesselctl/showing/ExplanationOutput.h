@@ -22,7 +22,7 @@ struct Explanation {
   const FilterDecision& decision;
   EntryProcess process;  // that recorded it; of an interval, its end
   std::string scope;     // the part of the downsampling table that decided; may be empty
-  std::string payload;   // JSON; empty where nothing would be sent or --payload is not given
+  std::string payload;   // JSON; empty where nothing would be reported or --payload is not given
 };
 
 // One JSON object on a line.

@@ -37,7 +37,7 @@ std::vector<std::string> notesOn(const StoreReading& reading) {
   if (std::string part = partOfPeriod(reading); !part.empty()) notes.push_back(std::move(part));
   if (reading.missingNumbers != 0 && reading.losses.sum(LossCode::entriesMissing) == 0)
     notes.push_back(grouped(reading.missingNumbers) +
-                    " numbers of entries that no file holds: vacuumed or lost");
+                    " numbers of entries that no file holds: vacuumed, not exported or lost");
   if (reading.filesOutsideRange != 0) {
     std::string note = grouped(reading.filesOutsideRange) + " not read, of another period:";
     for (const std::string& path : reading.outsideRange) note += " " + path;

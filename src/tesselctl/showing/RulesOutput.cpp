@@ -56,9 +56,9 @@ constexpr StringListSource kPerfLoggingLists[] = {perfLoggingComponentNames,
 std::string anyIfEmpty(std::string_view text) { return text.empty() ? "*" : std::string(text); }
 
 std::string shareWords(uint64_t cap, uint64_t ratio) {
-  if (cap == 0) return "none is sent";
+  if (cap == 0) return "none is reported";
   const std::string share = ratio == 1 ? "each" : "one in " + grouped(ratio);
-  return share + " is sent, until " + grouped(cap) +
+  return share + " is reported, until " + grouped(cap) +
          " were, as long as the service's process lives";
 }
 
@@ -169,7 +169,7 @@ constexpr char kPageHead[] = R"(# The rules of the build
 
 This page is the output of `tesselctl rules --markdown`.
 
-A labelled string of a marked trace point is sent only if its value stands on a list of the
+A labelled string of a marked trace point is reported only if its value stands on a list of the
 platform, letter for letter. If one string fails, the trace point is not reported: only its
 subsystem and category are counted. A build with internal diagnostics asks no list.
 `tesselctl rules check VALUE` says whether a value would pass, and
@@ -183,7 +183,7 @@ subsystem and category are counted. A build with internal diagnostics asks no li
 constexpr char kPageDownsampling[] = R"(
 ## Downsampling
 
-Of the trace points that a row covers, one in so many is sent, until the cap is reached. The
+Of the trace points that a row covers, one in so many is reported, until the cap is reached. The
 counters live as long as the service's process: under the timer that is one run. `*` stands for any.
 
 | platform | subsystem | category | name | cap | one in |
@@ -316,11 +316,11 @@ std::string rulesText(const PlatformProfile& profile, bool internal, const Termi
   const bool own = profile.platform == currentPlatform();
   std::string out =
       paragraph("Platform " + std::string(profile.name) + (own ? ", this build's" : "") +
-                ". A labelled string" + " is sent only if its value is one of these " +
+                ". A labelled string" + " is reported only if its value is one of these " +
                 grouped(stringWhitelistForPlatform(profile.platform).size()) +
                 ". All platforms: " + platformNames() + ".");
   if (internal)
-    out += paragraph("Internal diagnostics: this build asks no list, and every value is sent.");
+    out += paragraph("Internal diagnostics: this build asks no list, and every value is reported.");
   for (const StringListRow* row : listRows(profile.whitelist)) {
     out += "\n" + paragraph(terminal.paint(Colour::strong, listSummary(*row)));
     out += paragraph(joined(distinctValues(*row), " "), 2);

@@ -22,6 +22,7 @@ class Screen {
   std::string render() {
     // The dates below are of this zone.
     out_ = zonedText(status_.now) + "\n";
+    settings();
     line("Tasking", status_.tasking.decision.on() ? "on" : "off",
          status_.tasking.decision.on() ? Colour::good : Colour::caution, status_.taskingWords);
     line("Deferral", status_.deferral ? "wanted" : "none",
@@ -61,6 +62,16 @@ class Screen {
 
   std::string since(Date date) const {
     return dateText(date) + " (" + durationText(status_.now - date) + " ago)";
+  }
+
+  // Which files and limits are looked at depends on variables. The units may have others than this
+  // shell, so the screen says whose they are.
+  void settings() {
+    std::string names;
+    for (const std::string& name : status_.variables) names += (names.empty() ? "" : ", ") + name;
+    line("Settings", names.empty() ? "defaults" : "set here", Colour::plain,
+         (names.empty() ? "no TESSEL_ variable is set here" : names) +
+             "; those of the units are not read: systemctl cat tessel-reporter statora-forwarder");
   }
 
   void lastRun() {
@@ -208,7 +219,7 @@ class Screen {
       case SpoolReader::State::open:
         break;
       case SpoolReader::State::absent:
-        line("Spool", "none", Colour::plain, "nothing was sent");
+        line("Spool", "none", Colour::plain, "no run has reported anything yet");
         return;
       case SpoolReader::State::noAccess:
         line("Spool", "no access", Colour::caution, status_.spoolFailure);
@@ -279,10 +290,22 @@ class Screen {
     }
     const auto problems = static_cast<uint64_t>(
         std::count_if(status_.findings.begin(), status_.findings.end(), isBad));
-    line("All in all", problems == 0 ? "good" : "NOT GOOD",
-         problems == 0 ? Colour::good : Colour::bad,
-         (problems == 0 ? "none" : grouped(problems)) +
-             " of these problems: " + namesOf(status_.checked));
+    const std::string sum = (problems == 0 ? "none" : grouped(problems)) +
+                            " of these problems: " + namesOf(status_.checked);
+    const auto isIdle = [](const Finding& found) {
+      return found.code == FindingCode::nothingStartsRuns;
+    };
+    // A machine that reports nothing is not well, and not ill either. "good" would promise reports.
+    if (problems != 0) {
+      line("All in all", "NOT GOOD", Colour::bad, sum);
+    } else if (!status_.tasking.decision.on()) {
+      line("All in all", "off", Colour::caution, "this machine reports nothing; " + sum);
+    } else if (std::any_of(status_.findings.begin(), status_.findings.end(), isIdle)) {
+      line("All in all", "idle", Colour::caution,
+           "reporting is on, but nothing starts a run; " + sum);
+    } else {
+      line("All in all", "good", Colour::good, sum);
+    }
     for (const Finding& found : status_.findings) {
       if (isBad(found) && !found.because) inFull(found, "Problem", Colour::bad);
     }
@@ -298,8 +321,11 @@ class Screen {
     } else {
       const bool whole = status_.keepsADay();
       line("Journal", whole ? "whole day" : "part of day", whole ? Colour::good : Colour::plain,
-           store_ + ": oldest entry " + since(*status_.journal.oldest) +
-               (whole ? "" : "; a run looks back 24 h"));
+           store_ + (status_.journal.mayBeOlder ? ": first entry " : ": oldest entry ") +
+               since(*status_.journal.oldest) + (whole ? "" : "; a run looks back 24 h") +
+               (!whole && status_.journal.mayBeOlder
+                    ? ", and an export file may hold older entries further on"
+                    : ""));
     }
   }
 

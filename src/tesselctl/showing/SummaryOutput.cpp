@@ -208,9 +208,7 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
   for (size_t at = 0; at < shown; ++at) {
     const Tally::Miss& miss = misses[at];
     table.add({terminal.number(miss.count), "\"" + terminalText(miss.value) + "\"",
-               std::to_string(miss.slot),
-               terminalText(miss.subsystem) + " / " + terminalText(miss.category) + " / " +
-                   terminalText(miss.name)});
+               std::to_string(miss.slot), pathText(miss.subsystem, miss.category, miss.name)});
   }
   std::string out = table.render(terminal, 2) + more(shown, misses.size(), "values");
   // The tally keeps a bounded number of values. JSON lacks the others as well, so the line does not

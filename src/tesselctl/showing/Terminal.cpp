@@ -349,4 +349,11 @@ void ProgressBar::clear() {
   visible_ = false;
 }
 
+std::string pathText(std::string_view subsystem, std::string_view category, std::string_view name) {
+  std::string path = (subsystem.empty() ? "-" : terminalText(subsystem)) + " / " +
+                     (category.empty() ? "-" : terminalText(category));
+  if (!name.empty()) path += " / " + terminalText(name);
+  return path;
+}
+
 }  // namespace tessel::ctl

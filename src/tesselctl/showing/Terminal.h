@@ -92,6 +92,9 @@ class Table {
 // `text` broken between words to `width` columns; lines after the first begin with `indent` spaces.
 // A word that is longer than a line stands alone and loses its middle.
 std::string wrapped(std::string_view text, size_t width, size_t indent);
+// "com.vantor.Calendar / View / Open", fit for a terminal; without a name "com.vantor.Calendar /
+// View".
+std::string pathText(std::string_view subsystem, std::string_view category, std::string_view name);
 // The same beside a label of `indent` columns, which the caller writes before the first line. On a
 // terminal too narrow for that, lines are 12 columns wide behind the label. A label that is longer
 // reaches `beyond` columns further on the first line.
