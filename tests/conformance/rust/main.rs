@@ -76,7 +76,7 @@ impl Runner {
             "r" => (0..next().parse::<i32>().unwrap()).filter(|_| self.point.event().is_err()).count() as i32,
             "z" => {
                 let size = 4096;
-                (3..64).for_each(|fd| unsafe { drop(setsockopt(fd, 1, 7, (&size as *const i32).cast(), 4)) });
+                (3..64).for_each(|fd| unsafe { setsockopt(fd, 1, 7, (&size as *const i32).cast(), 4); });
                 0
             }
             _ => {
