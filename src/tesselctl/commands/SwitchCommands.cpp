@@ -24,7 +24,7 @@ namespace tessel::ctl {
 namespace {
 
 // The service runs as a user of its own and must be able to read what we write as root.
-constexpr unsigned kReadableByAll = 0644;
+constexpr unsigned kConfigurationMode = 0644;
 
 struct SwitchOptions {
   bool json = false;
@@ -78,7 +78,7 @@ int deferOn(const SwitchOptions& options, const Surroundings& surroundings) {
   // The kernel makes the file only if there is none. So `made` is true for one caller alone, and a
   // script can trust "changed" to know whether it must switch back. errno is copied at once,
   // because later calls change it.
-  const bool made = createNewFile(file, kReadableByAll);
+  const bool made = createNewFile(file, kConfigurationMode);
   const int error = errno;
   if (!made && error != EEXIST) return failToWrite(fileError(file, error));
   // We make the file all the same. The service may have been started with another environment than
@@ -177,7 +177,7 @@ int switchTasking(const SwitchOptions& options, const Surroundings& surroundings
   if (const auto* failure = std::get_if<PlatformError>(&noted)) return failToWrite(*failure);
   if (!std::get<bool>(noted)) changed = changedConfiguration(file, false);
   if (const auto* refusal = std::get_if<PlatformError>(&changed)) return failToWrite(*refusal);
-  if (const auto failure = replaceFileDurably(file, std::get<std::string>(changed), kReadableByAll))
+  if (const auto failure = replaceFileDurably(file, std::get<std::string>(changed), kConfigurationMode))
     return failToWrite(*failure);
   // We show what the rules of the service now decide, not what was asked for: an internal build
   // reports even after "off".
