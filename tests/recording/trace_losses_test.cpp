@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
@@ -49,12 +50,18 @@ class Taking {
     thread_.join();
     return std::move(entries_);
   }
+  // The longest time, in milliseconds, in which nothing was taken; after stop().
+  int64_t longestPause() const { return longestPause_; }
 
  private:
   void append(std::vector<JournalEntry> entries) {
+    longestPause_ = std::max(longestPause_, milliseconds(Clock::now() - last_));
+    last_ = Clock::now();
     for (JournalEntry& entry : entries) entries_.push_back(std::move(entry));
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
+  Clock::time_point last_ = Clock::now();
+  int64_t longestPause_ = 0;
   std::vector<JournalEntry> entries_;
   std::atomic<bool> stop_ = false;
   std::thread thread_;
@@ -152,13 +159,19 @@ TEST_F(TraceLosses, TheTotalStopsAtTheGreatestNumber) {
   EXPECT_EQ(only()["TESSEL_LOST"], std::to_string(most));
 }
 
+// A call waits 20 ms. On a busy machine the journal may pause longer; then another burst shows the
+// rule.
 TEST_F(TraceLosses, ABurstWaitsForAJournalThatTakesPoints) {
   const tessel_point point = somePoint();
-  Taking taking(journal);
-  int failed = 0;
-  for (int i = 0; i < 3000; ++i) failed += tessel_event(&point) != 0;
-  EXPECT_EQ(failed, 0);
-  EXPECT_EQ(taking.stop().size(), 3000u);
+  for (int64_t pause = 20, bursts = 0; pause >= 10; ++bursts) {
+    ASSERT_LT(bursts, 200);
+    Taking taking(journal);
+    size_t failed = 0;
+    for (int i = 0; i < 3000; ++i) failed += tessel_event(&point) != 0;
+    EXPECT_EQ(taking.stop().size() + failed, 3000u);
+    pause = taking.longestPause();
+    EXPECT_TRUE(failed == 0 || pause >= 10) << failed;
+  }
 }
 
 size_t openDescriptors() {
