@@ -49,6 +49,7 @@ class HealthRecords(MachineTest):
         self.assertNotIn("tessel.health", [one["name"] for one in self.sent()])
 
     def test_a_machine_that_is_not_tasked_tells_its_health(self):
+        self.machine.write_export(some_points(1))
         self.machine.task('{"TaskedOn": false}')
         self.run_clean()
         with Receiver() as receiver:
@@ -62,7 +63,6 @@ class HealthRecords(MachineTest):
         self.assertEqual((told["TaskedOn"], told["Good"], told["Runs"], told["StatusTime"]),
                          (False, True, "[]", saved["time"]))
         self.machine.task()
-        self.machine.write_export(some_points(1))
         self.run_clean()
         self.assertTrue(self.machine.rows(), "the service takes the spool for its own")
 

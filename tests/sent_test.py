@@ -130,7 +130,8 @@ class Shown(SentTest):
 
         def names():
             process.tessel_output.seek(0)
-            return [json.loads(line)["name"] for line in process.tessel_output.read().splitlines()]
+            written = process.tessel_output.read()  # it may end within a line
+            return [json.loads(line)["name"] for line in written[:written.rfind(b"\n") + 1].splitlines()]
 
         wait_for(lambda: len(names()) == count)
         self.send()

@@ -177,7 +177,8 @@ int switchTasking(const SwitchOptions& options, const Surroundings& surroundings
   if (const auto* failure = std::get_if<PlatformError>(&noted)) return failToWrite(*failure);
   if (!std::get<bool>(noted)) changed = changedConfiguration(file, false);
   if (const auto* refusal = std::get_if<PlatformError>(&changed)) return failToWrite(*refusal);
-  if (const auto failure = replaceFileDurably(file, std::get<std::string>(changed), kConfigurationMode))
+  if (const auto failure =
+          replaceFileDurably(file, std::get<std::string>(changed), kConfigurationMode))
     return failToWrite(*failure);
   // We show what the rules of the service now decide, not what was asked for: an internal build
   // reports even after "off".
