@@ -99,9 +99,10 @@ class StatusTest(MachineTest):
     def tasking_file(self):
         return os.path.join(self.machine.config, harness.TASKING)
 
-    def forward(self, answer):
+    def forward(self, answer, **extra):
         with Receiver(lambda request, number: answer) as receiver:
-            environment = self.machine.environment(OTEL_EXPORTER_OTLP_ENDPOINT=receiver.url, TESSEL_FORWARD_RATE="0")
+            environment = self.machine.environment(OTEL_EXPORTER_OTLP_ENDPOINT=receiver.url, TESSEL_FORWARD_RATE="0",
+                                                   **extra)
             subprocess.run([os.path.join(BIN, "statora_forwarder"), "--once"], env=environment, capture_output=True,
                            check=False, timeout=60)
 

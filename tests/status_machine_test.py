@@ -172,6 +172,33 @@ class Spool(StatusTest):
         self.service()
         self.assertEqual(self.problems(), {}, "rows of this moment wait")
 
+    def test_a_forwarder_may_wait_by_its_settings(self):
+        self.service()
+        hours = lambda count: int((time.time() + count * 3600) * 1e6)
+        self.spool("UPDATE events SET time = ?", hours(-3))
+        self.forward(Answer(401))
+        self.assertEqual(self.problems(), {"forwarder_stuck": None})
+        process = subprocess.Popen([os.path.join(BIN, "statora_forwarder")], stderr=subprocess.DEVNULL,
+                                   env=self.machine.environment(OTEL_EXPORTER_OTLP_ENDPOINT="http://localhost:1",
+                                                                TESSEL_FORWARD_SPREAD="31536000"))
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+        wait_for(lambda: self.status()["forwarder"].get("next_attempt", 0) > hours(0))
+        process.kill()
+        process.wait()
+        self.assertEqual(self.problems(), {}, "it waits for its turn in the fleet")
+        for since, until, problems in ((-9, -1, {}), (-9, -2.1, {"forwarder_stuck": None}),
+                                       (1, 9, {"forwarder_stuck": None}), (-1, 9, {})):
+            self.spool("INSERT OR REPLACE INTO forwarder VALUES('rests_since', ?), ('next_attempt', ?)", hours(since), hours(until))
+            self.assertEqual(self.problems(), problems, (since, until))
+        self.forward(Answer(401))
+        self.assertLessEqual(self.status()["forwarder"]["next_attempt"], hours(0), "the wait ended with this attempt")
+        self.forward(Answer(), TESSEL_FORWARD_INTERVAL="86400")
+        self.service()
+        self.spool("UPDATE events SET time = ?", hours(-3))
+        self.spool("UPDATE forwarder SET value = ? WHERE name = 'last_success'", hours(-4))
+        self.assertEqual(self.problems(), {}, "it looks once a day")
+
     def test_a_wait_that_the_collector_orders_is_noted(self):
         self.service()
         with Receiver(lambda request, number: Answer(503, headers={"Retry-After": "600"})) as receiver:

@@ -347,6 +347,7 @@ void Forwarder::endRound() {
   if (outcome_ == ForwarderOutcome::spoolFailed)
     pause_ = backoff_.wait(spoolFailures_, world_.chance(), {});
   if (outcome_ == ForwarderOutcome::delivered) heldRounds_ = 0;
+  noteRest(outcome_ == ForwarderOutcome::delivered ? pause_ : std::chrono::nanoseconds{0});
   if (outcome_ != ForwarderOutcome::held && outcome_ != ForwarderOutcome::unreachable) return;
   ForwarderCounters& counters = world_.state.counters();
   if (outcome_ == ForwarderOutcome::unreachable) {
@@ -365,6 +366,11 @@ void Forwarder::endRound() {
   counters.orderedUntil =
       answer_.retryAfter ? counters.lastErrorAt + static_cast<uint64_t>(wait.count()) : 0;
   world_.state.storeCounters();
+}
+
+void Forwarder::noteRest(std::chrono::nanoseconds time) {
+  if (!world_.state.exists() || !world_.state.open().ok()) return;
+  if (world_.state.counters().rest(world_.clock.now(), time)) world_.state.storeCounters();
 }
 
 void Forwarder::sayProgress() {

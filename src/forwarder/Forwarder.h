@@ -76,6 +76,9 @@ class Forwarder {
   ForwarderOutcome deliverAll();
   // How long to wait after the last round.
   std::chrono::nanoseconds pause() const { return pause_; }
+  // Notes in the spool that the forwarder waits so long by its own settings. `tesselctl status`
+  // does not take such a wait for a forwarder that hangs. Does nothing if there is no spool.
+  void noteRest(std::chrono::nanoseconds time);
   // Why the last outcome was not `delivered`, in words. Empty after `delivered` and `stopped`.
   const std::string& reason() const { return reason_; }
   // Whether the spool still holds rows that the collector has taken.

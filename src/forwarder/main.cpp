@@ -156,8 +156,10 @@ class Service {
     manager_->ready();
     manager_->say("Waiting for its turn in the fleet");
     // A fleet that starts in the same minute must not reach the collector in the same second.
-    const std::chrono::duration<double> turn = settings_.spread * chance();
-    bool stopped = clock_.wait(stop_, std::chrono::duration_cast<std::chrono::nanoseconds>(turn));
+    const std::chrono::nanoseconds turn{
+        std::chrono::duration_cast<std::chrono::nanoseconds>(settings_.spread * chance())};
+    forwarder_.noteRest(turn);
+    bool stopped = clock_.wait(stop_, turn);
     while (!stopped) {
       const ForwarderOutcome outcome = round();
       stopped = outcome == ForwarderOutcome::stopped || pause(outcome);

@@ -27,12 +27,18 @@ constexpr Counter kCounters[] = {
     {"last_success", &ForwarderCounters::lastSuccess},
     {"last_error_at", &ForwarderCounters::lastErrorAt},
     {"ordered_until", &ForwarderCounters::orderedUntil},
+    {"rests_since", &ForwarderCounters::restsSince},
+    {"next_attempt", &ForwarderCounters::nextAttempt},
 };
 // Stands in the same table, because a column of SQLite takes a text as well as a number.
 constexpr std::string_view kLastError = "last_error";
 
 // Whoever may write to the spool can put any number there. Up to this one, sums cannot overflow.
 constexpr int64_t kMostCounted = int64_t{1} << 60;
+
+// `tesselctl status` allows a silence of two hours. Shorter waits need no note, and a note every 30
+// seconds would keep an idle disk awake.
+constexpr std::chrono::minutes kLongRest{10};
 
 }  // namespace
 
@@ -60,6 +66,17 @@ bool writeForwarderCounters(SqliteStatement& insert, const ForwarderCounters& co
         .bind(2, static_cast<int64_t>(counters.*counter.value))
         .run();
   });
+}
+
+// A short wait ends a longer one that was noted and lies ahead. Otherwise a forwarder that fails in
+// the middle of its rest would seem to rest on.
+bool ForwarderCounters::rest(Date now, std::chrono::nanoseconds time) {
+  const uint64_t begin = microsecondsSince1970(now);
+  if (time < kLongRest && nextAttempt <= begin) return false;
+  const auto wait = std::chrono::duration_cast<std::chrono::microseconds>(time);
+  restsSince = begin;
+  nextAttempt = begin + static_cast<uint64_t>(wait.count());
+  return true;
 }
 
 uint64_t microsecondsSince1970(Date date) {

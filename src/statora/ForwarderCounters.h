@@ -28,6 +28,13 @@ struct ForwarderCounters {
   std::string lastError;
   uint64_t lastErrorAt = 0;   // microseconds since 1970; 0: never
   uint64_t orderedUntil = 0;  // until when the collector then asked us to wait; 0: it did not
+  // The last long wait that nobody ordered: for the next look, or for the turn at a start. Without
+  // it a forwarder that waits by its settings looks like one that hangs.
+  uint64_t restsSince = 0;   // microseconds since 1970; 0: there was none
+  uint64_t nextAttempt = 0;  // its end
+
+  // Takes note of a wait that begins now. False if it is too short to be worth storing.
+  bool rest(Date now, std::chrono::nanoseconds time);
 
   bool operator==(const ForwarderCounters&) const = default;
 };

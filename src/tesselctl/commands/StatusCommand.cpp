@@ -104,6 +104,8 @@ void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("failed_requests", counters.failedRequests);
   json.member("bytes_sent", counters.bytesSent).member("position", counters.position);
   json.member("last_success", counters.lastSuccess);
+  if (counters.nextAttempt != 0)
+    json.member("rests_since", counters.restsSince).member("next_attempt", counters.nextAttempt);
   if (counters.lastErrorAt == 0) return;
   json.member("last_error", counters.lastError).member("last_error_at", counters.lastErrorAt);
   if (counters.orderedUntil != 0) json.member("ordered_until", counters.orderedUntil);

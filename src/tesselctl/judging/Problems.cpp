@@ -256,6 +256,10 @@ class StatusJudge {
     const Date success = at(forwarder->lastSuccess), order = at(forwarder->orderedUntil);
     if (age(success)) since = std::max(*since, success);
     if (order < status_.now + kLongestOrder) since = std::max(*since, order);
+    // What the forwarder waits by its settings is no silence. Its interval may be as long as a
+    // year. So the begin of the wait tells whether the clock was set back since.
+    if (const Date next = at(forwarder->nextAttempt); age(at(forwarder->restsSince)))
+      since = std::max(*since, next);
     const auto silent = age(*since);
     if (!silent || *silent <= kLongestWithoutDelivery) return;
     std::string words = "The forwarder has delivered nothing for " + durationText(*silent) +
@@ -265,8 +269,7 @@ class StatusJudge {
       words += "the last error" + (ago ? ", " + durationText(*ago) + " ago" : std::string()) +
                ": " + shortPlainText(forwarder->lastError, kMaxErrorBytes);
     } else {
-      words +=
-          "it has told no error since, so it does not run, or its own settings make it wait longer";
+      words += "it has told no error since, so it does not run";
     }
     add(FindingCode::forwarderStuck, std::move(words), *since);
   }
