@@ -167,8 +167,8 @@ class Dates(MachineTest):
         day, clock = r"20\d\d-\d\d-\d\d", r"\d\d:\d\d:\d\d"
         for zone in ("Europe/Berlin", "America/St_Johns"):
             for form, date in (("short", rf"\w+ \d+ {clock}"), ("short-precise", rf"\w+ \d+ {clock}\.\d+"), ("short-full", rf"\w+ {day} {clock} \w+"),
-                               ("with-unit", rf"\w+ {day} {clock} \w+"), ("short-iso", rf"{day}T{clock}[+-]\d+"), ("verbose", rf"\w+ {day} {clock}\.\d+ \w+"),
-                               ("short-iso-precise", rf"{day}T{clock}\.\d+[+-]\d+"), ("short-unix", r"\d+\.\d+")):
+                               ("with-unit", rf"\w+ {day} {clock} \w+"), ("short-iso", rf"{day}T{clock}[+-][\d:]+"), ("verbose", rf"\w+ {day} {clock}\.\d+ \w+"),
+                               ("short-iso-precise", rf"{day}T{clock}\.\d+[+-][\d:]+"), ("short-unix", r"\d+\.\d+")):
                 printed = subprocess.run(["journalctl", "--file", path, "-q", "-o", form], capture_output=True, text=True, check=True,
                                          env={**os.environ, "TZ": zone, "LC_ALL": "C"}).stdout
                 dates = re.findall(rf"(?m)^{date}(?= )", printed)

@@ -32,7 +32,7 @@ def exported(count, source=0, boots=1, start=START, clock=lambda index: 0):
         boot = index * boots // count
         text.append(f"__REALTIME_TIMESTAMP={start + index * 1000 + clock(index)}\n"
                     f"__MONOTONIC_TIMESTAMP={start % 10**9 + (index - boot * count // boots) * 1000}\n"
-                    f"_BOOT_ID={boot:032x}\nMESSAGE=message {source} {index}\n_PID={index % 50}\nPRIORITY=6\n".encode())
+                    f"_BOOT_ID={boot + 1:032x}\nMESSAGE=message {source} {index}\n_PID={index % 50}\nPRIORITY=6\n".encode())
         if index % 7 == 0:
             text.append(b"LARGE=" + rng.randbytes(20).hex().encode() * (50 + index % 150) + b"\n")
         if index % 9 == 0:

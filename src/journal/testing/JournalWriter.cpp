@@ -48,6 +48,8 @@ constexpr size_t kArenaSizeAt = 96;
 constexpr size_t kDataTableAt = 104;
 constexpr size_t kFieldTableAt = 120;
 constexpr size_t kFieldCountAt = 216;
+constexpr size_t kTailArrayAt = 256;  // and four bytes behind it, how many entries it has
+constexpr size_t kTailEntryAt = 264;
 constexpr size_t kDataFirstEntryAt = 40;
 constexpr size_t kDataEntryArrayAt = 48;
 constexpr uint64_t kBuckets = 8;
@@ -155,6 +157,11 @@ void JournalWriter::add(EntryHeader header, const std::vector<std::string>& fiel
     putOffset(offset + kEntryItemsAt + i * itemSize, items[i]->offset);
   link(all_, offset);
   entries_.push_back(offset);
+  if (layout_.headerSize > kTailArrayAt) {
+    put<uint32_t>(kTailArrayAt, static_cast<uint32_t>(all_.arrays.back()));
+    put<uint32_t>(kTailArrayAt + 4, static_cast<uint32_t>(all_.used));
+  }
+  if (layout_.headerSize > kTailEntryAt) put<uint64_t>(kTailEntryAt, offset);
   put<uint64_t>(kEntryCountAt, entries_.size());
   for (Data* item : items) link(*item, offset);
   if (entries_.size() == 1) {
