@@ -17,7 +17,7 @@ import tempfile
 import time
 import unittest
 
-BIN = os.environ.get("TESSEL_BIN") or os.path.join(os.path.dirname(os.path.abspath(__file__)), "../build/dev/bin")
+BIN = os.path.abspath(os.environ.get("TESSEL_BIN") or os.path.join(os.path.dirname(__file__), "../build/dev/bin"))
 SANITIZED = bool(os.environ.get("TESSEL_SANITIZE"))
 REMOTE = "/lib/systemd/systemd-journal-remote"
 MARKER = "tessel_reporter_running"
