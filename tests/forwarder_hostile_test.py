@@ -74,7 +74,11 @@ class OneForwarder(ForwarderTest):
 
 class Surroundings(ForwarderTest):
     def test_a_dry_run_obeys_signals_and_sees_a_full_disk(self):
+        self.run_forwarder(None, "--dry-run")
+        self.assertEqual(self.errors, "No event waits.\n")
         self.add(5000)
+        reader = subprocess.run(f"{FORWARDER} --dry-run | head -n 1", shell=True, env=self.environment(None), capture_output=True, check=True)
+        self.assertEqual((reader.stdout, reader.stderr), (b"request\n", b""))
         with open("/dev/full", "w") as full:
             result = subprocess.run([FORWARDER, "--dry-run"], env=self.environment(None), stdout=full, stderr=subprocess.PIPE,
                                     text=True, timeout=60, check=False)

@@ -259,6 +259,7 @@ class Process(ForwarderTest):
                 told += manager.recv(4096).decode()
             process.send_signal(signal.SIGTERM)
             self.assertEqual(process.wait(60), 0)
+        self.assertRegex(told, r"STATUS=Waiting for its turn in the fleet, until \d\d:\d\d:\d\d\n")
         self.assertEqual(self.waiting(), 0)
 
     def test_a_spool_that_was_replaced_is_noticed(self):

@@ -9,7 +9,9 @@
 #include <sysexits.h>
 
 #include <CLI/CLI.hpp>
+#include <cerrno>
 #include <cstdio>
+#include <ctime>
 #include <iostream>
 #include <random>
 
@@ -28,6 +30,37 @@ namespace {
 
 constexpr char kText[] = "text";
 constexpr char kRaw[] = "raw";
+
+// Written by hand, because the parser would show "--dry-run{text}:{text,raw}". A test holds it
+// against the manual.
+constexpr char kHelp[] =
+    R"(Sends the events of the spool to a collector (OTLP over HTTP), or as
+newline-delimited JSON to any URL.
+Usage: /usr/lib/tessel/statora_forwarder [OPTION]
+
+Without an option it stays and sends what comes, as the service
+statora-forwarder.service does.
+
+Options:
+  --once             Send what waits now, then end
+  --dry-run[=raw]    Print what would be sent, as text or as the very bytes;
+                     send and change nothing
+  --requeue          Let the rows that a collector refused wait again, then end
+  -h,--help          Print this help message and exit
+  --version          Print the version
+
+Settings are environment variables; statora_forwarder(8) lists them. The one
+that it needs is OTEL_EXPORTER_OTLP_ENDPOINT, the URL of the collector. Those of
+the service stand in /etc/statora/forwarder.env, and a shell does not have them.
+See what the service would send:
+  systemd-run -qP -p User=statora-forwarder \
+    -p EnvironmentFile=-/etc/statora/forwarder.env \
+    /usr/lib/tessel/statora_forwarder --dry-run
+
+Exit status: 0 sent, or asked to end; 64 no such option; 66 the spool cannot
+be used; 69 the collector takes nothing; 74 the output cannot be written; 75
+no answer, or another forwarder is at work; 78 a variable makes no sense.
+)";
 
 struct Arguments {
   bool once = false;
@@ -50,16 +83,23 @@ int dryRun(const LaunchConfiguration& launch, const Encoder& encoder) {
     std::cerr << "The spool cannot be read: " << status.reason << '\n';
     return EX_NOINPUT;
   }
+  bool printed = false;
   for (int64_t after = 0;;) {
     std::vector<SpooledEvent> events = state.oldest(options.maxRecords, options.maxBytes, after);
     if (events.empty()) break;
     const Batch batch = cutBatch(std::move(events), encoder, state.spoolId(), options.maxBytes);
     after = batch.lastId;
-    if (!batch.records.empty()) std::cout << encoder.body(batch.records) << std::flush;
-    // A disk without room, or a reader that has gone.
+    if (batch.records.empty()) continue;
+    printed = true;
+    std::cout << encoder.body(batch.records) << std::flush;
+    // A reader that goes, as `head` does, has seen enough. Else it is a disk without room.
+    if (!std::cout && errno == EPIPE) return EX_IOERR;
     if (!std::cout) break;
   }
-  if (state.status().ok() && std::cout) return 0;
+  if (state.status().ok() && std::cout) {
+    if (!printed) std::cerr << "No event waits.\n";
+    return 0;
+  }
   std::cerr << (std::cout ? state.status().reason : "The output cannot be written") << '\n';
   return EX_IOERR;
 }
@@ -154,10 +194,10 @@ class Service {
 
   int runForEver() {
     manager_->ready();
-    manager_->say("Waiting for its turn in the fleet");
     // A fleet that starts in the same minute must not reach the collector in the same second.
     const std::chrono::nanoseconds turn{
         std::chrono::duration_cast<std::chrono::nanoseconds>(settings_.spread * chance())};
+    manager_->say("Waiting for its turn in the fleet, until " + clockTime(turn));
     forwarder_.noteRest(turn);
     bool stopped = clock_.wait(stop_, turn);
     while (!stopped) {
@@ -197,8 +237,20 @@ class Service {
     if (added && outcome == ForwarderOutcome::delivered) outcome = forwarder_.deliverAll();
     const std::string& words = forwarder_.reason();
     complaints_.tell(words);
-    manager_->say(words.empty() ? "Delivered what there was" : words);
+    manager_->say(words.empty() ? "Delivered what there was"
+                                : words + "; next attempt at " + clockTime(forwarder_.pause()));
     return outcome;
+  }
+
+  // The time of day when such a wait ends. Whoever reads the status does not know when it began.
+  std::string clockTime(std::chrono::nanoseconds wait) {
+    const auto end = clock_.now() + std::chrono::ceil<std::chrono::microseconds>(wait);
+    const std::time_t seconds =
+        std::chrono::system_clock::to_time_t(std::chrono::ceil<std::chrono::seconds>(end));
+    std::tm parts{};
+    ::localtime_r(&seconds, &parts);
+    char text[sizeof "23:59:59"];
+    return {text, std::strftime(text, sizeof text, "%H:%M:%S", &parts)};
   }
 
   bool isSpoolOpen() { return state_.exists() && state_.open().ok(); }
@@ -281,21 +333,16 @@ int run(const Arguments& arguments) {
 int main(int argc, char** argv) {
   tessel::prepareProcess();
   tessel::blockSignal(SIGTERM);
-  CLI::App app(
-      "Ships the events of the spool to an OpenTelemetry collector (OTLP over HTTP),\nor as NDJSON "
-      "to any URL.");
-  app.set_version_flag("--version", "statora_forwarder " TESSEL_VERSION, "Print the version");
-  app.footer(
-      "Where to is OTEL_EXPORTER_OTLP_ENDPOINT's to say. See what would be sent:\n  "
-      "statora_forwarder --dry-run");
+  CLI::App app;
+  app.formatter_fn([](const CLI::App*, std::string, CLI::AppFormatMode) -> std::string {
+    return tessel::kHelp;
+  });
+  app.set_version_flag("--version", "statora_forwarder " TESSEL_VERSION);
   tessel::Arguments arguments;
-  auto* const once = app.add_flag("--once", arguments.once, "Deliver what waits now, then end");
-  auto* const dryRun =
-      app.add_flag("--dry-run{text}", arguments.dryRun,
-                   "Print what would be sent; send and change nothing. =raw: the very bytes")
-          ->check(CLI::IsMember({tessel::kText, tessel::kRaw}));
-  auto* const requeue = app.add_flag("--requeue", arguments.requeue,
-                                     "Let what was set aside wait for delivery again, then end");
+  auto* const once = app.add_flag("--once", arguments.once);
+  auto* const dryRun = app.add_flag("--dry-run{text}", arguments.dryRun)
+                           ->check(CLI::IsMember({tessel::kText, tessel::kRaw}));
+  auto* const requeue = app.add_flag("--requeue", arguments.requeue);
   once->excludes(dryRun, requeue);
   dryRun->excludes(requeue);
   try {
