@@ -1,6 +1,8 @@
 #!/usr/bin/env python3
-"""collector.py FILE: takes OTLP/HTTP logs on port 4318; a line in FILE for each request says how many
-records it held."""
+"""collector.py FILE: takes OTLP/HTTP logs on a free port, which FILE.port names; a line in FILE for each request
+says how many records it held.
+
+The container has the network of the machine, so another collector may have the usual port."""
 import gzip
 import http.server
 import sys
@@ -22,4 +24,7 @@ class Collector(http.server.BaseHTTPRequestHandler):
         self.end_headers()
 
 
-http.server.HTTPServer(("127.0.0.1", 4318), Collector).serve_forever()
+server = http.server.HTTPServer(("127.0.0.1", 0), Collector)
+with open(sys.argv[1] + ".port", "w", encoding="utf-8") as port:
+    print(server.server_port, file=port)
+server.serve_forever()
