@@ -306,7 +306,7 @@ bool Forwarder::leaveBehind(const std::string& words) {
 
 // Waits. False if somebody asked to stop.
 bool Forwarder::takeBreak(std::chrono::nanoseconds time) {
-  if (!world_.clock.wait(world_.stop, time)) return true;
+  if (!world_.threads.wait(world_.stop, time)) return true;
   // This wait has used the signal up. Signal again, because later waits must see it too.
   world_.stop.signal();
   return fail(ForwarderOutcome::stopped, {});

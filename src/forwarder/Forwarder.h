@@ -65,6 +65,7 @@ class Forwarder {
     const Encoder& encoder;
     Collector& collector;
     Clock& clock;
+    Threads& threads;
     ServiceStatus& status;
     Semaphore& stop;
     std::function<double()> chance;

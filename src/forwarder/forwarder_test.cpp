@@ -93,8 +93,8 @@ class ForwarderTest : public ::testing::Test {
   }
   // A new process has a new forwarder.
   void restart() {
-    forwarder_.emplace(Forwarder::World{state_, encoder_, collector_, clock_, status_, stop_,
-                                        [this] { return chance_; }},
+    forwarder_.emplace(Forwarder::World{state_, encoder_, collector_, clock_, clock_, status_,
+                                        stop_, [this] { return chance_; }},
                        options_);
   }
   // Rounds with the waits between them, as the program does them.

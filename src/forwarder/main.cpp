@@ -127,11 +127,10 @@ int requeue(const std::string& stateDirectory) {
 
 // Makes SIGTERM and SIGINT end every wait and the present request. Otherwise a collector that hangs
 // would keep the process until the timeout.
-void stopOnSignals(Semaphore& stop, CurlCollector& collector) {
-  const auto queue =
-      std::make_shared<WorkerQueue>("statora_forwarder signal queue", QueueThread::own);
+void stopOnSignals(Semaphore& stop, CurlCollector& collector, Threads& threads) {
+  const auto queue = std::make_shared<WorkerQueue>("statora_forwarder signal queue", threads);
   for (const int signalNumber : {SIGTERM, SIGINT}) {
-    const auto source = std::make_shared<ThreadSignalSource>(signalNumber, queue);
+    const auto source = std::make_shared<ThreadSignalSource>(signalNumber, queue, threads);
     source->setHandler([&stop, &collector] {
       collector.cancel();
       stop.signal();
@@ -173,20 +172,21 @@ class Complaints {
 class Service {
  public:
   Service(const LaunchConfiguration& launch, const ForwarderSettings& settings,
-          const Encoder& encoder, Semaphore& stop, CurlCollector& collector)
+          const Encoder& encoder, Semaphore& stop, CurlCollector& collector, Threads& threads)
       : settings_(settings),
         stop_(stop),
+        threads_(threads),
         state_(launch.stateDirectory),
         health_(launch.stateDirectory, state_),
         manager_(connectServiceManager(clock_)),
         collector_(collector),
-        forwarder_({state_, encoder, collector, clock_, *manager_, stop, chance},
+        forwarder_({state_, encoder, collector, clock_, threads, *manager_, stop, chance},
                    optionsFor(settings)) {}
 
   int runOnce() {
     ForwarderOutcome outcome = round();
     for (uint32_t rounds = 1; rounds < kRoundsAtOnce && mayHelpToWait(outcome); ++rounds) {
-      outcome = clock_.wait(stop_, forwarder_.pause()) ? ForwarderOutcome::stopped : round();
+      outcome = threads_.wait(stop_, forwarder_.pause()) ? ForwarderOutcome::stopped : round();
     }
     end();
     return exitStatus(outcome);
@@ -199,7 +199,7 @@ class Service {
         std::chrono::duration_cast<std::chrono::nanoseconds>(settings_.spread * chance())};
     manager_->say("Waiting for its turn in the fleet, until " + clockTime(turn));
     forwarder_.noteRest(turn);
-    bool stopped = clock_.wait(stop_, turn);
+    bool stopped = threads_.wait(stop_, turn);
     while (!stopped) {
       const ForwarderOutcome outcome = round();
       stopped = outcome == ForwarderOutcome::stopped || pause(outcome);
@@ -260,11 +260,11 @@ class Service {
   bool pause(ForwarderOutcome outcome) {
     std::chrono::nanoseconds left = forwarder_.pause();
     while (outcome == ForwarderOutcome::held && left > settings_.interval) {
-      if (clock_.wait(stop_, settings_.interval)) return true;
+      if (threads_.wait(stop_, settings_.interval)) return true;
       if (collector_.hasNewCredentials()) return false;
       left -= settings_.interval;
     }
-    return clock_.wait(stop_, left);
+    return threads_.wait(stop_, left);
   }
 
   // What the collector has taken and the spool still holds would be sent again by the next start.
@@ -274,6 +274,7 @@ class Service {
 
   const ForwarderSettings& settings_;
   Semaphore& stop_;
+  Threads& threads_;
   SystemClock clock_;
   ForwarderState state_;
   Health health_;
@@ -285,13 +286,14 @@ class Service {
 
 int forward(const LaunchConfiguration& launch, const ForwarderSettings& settings, bool once) {
   curl_global_init(CURL_GLOBAL_DEFAULT);
-  // Never deleted: the signal thread uses them for as long as the process lives.
+  // Never deleted: the signal threads use them for as long as the process lives.
+  auto& threads = *new StandardThreads;
   auto& stop = *new Semaphore(0);
   const auto encoder = settings.output->makeEncoder(
       readResources(launch.osReleasePath, settings.resourceAttributes, settings.sendInstanceId));
   auto& collector = *new CurlCollector(settings, encoder->contentType());
-  stopOnSignals(stop, collector);
-  Service service(launch, settings, *encoder, stop, collector);
+  stopOnSignals(stop, collector, threads);
+  Service service(launch, settings, *encoder, stop, collector, threads);
   return once ? service.runOnce() : service.runForEver();
 }
 

@@ -220,34 +220,37 @@ class Delivery final : public Activity {
 BackgroundScheduler::BackgroundScheduler(ScheduleCriteria criteria, const StateDirectory& state,
                                          const DeferralConditions& conditions,
                                          ServiceRuntime& runtime, ServiceStatus& status,
-                                         Clock& clock)
+                                         Clock& clock, Threads& threads)
     : criteria_(criteria),
       state_(state),
       conditions_(conditions),
       runtime_(runtime),
       status_(status),
-      clock_(clock) {}
+      clock_(clock),
+      threads_(threads) {}
 
 void BackgroundScheduler::registerActivity(const std::string& /*name*/, ActivityHandler handler) {
   // The process must not end while a delivery is pending. `pending` keeps it alive until the thread
   // ends.
   const std::shared_ptr<KeepAliveTransaction> pending = runtime_.expectDelivery();
-  startThread([pending, deliveries = ActivityDeliveries(criteria_, state_, conditions_, status_,
-                                                        clock_, std::move(handler))]() mutable {
-    deliveries.deliverCheckIn();
-    while (deliveries.deliverRun()) {
+  const auto deliveries = std::make_shared<ActivityDeliveries>(
+      criteria_, state_, conditions_, status_, clock_, threads_, std::move(handler));
+  startThread(threads_, [pending, deliveries] {
+    deliveries->deliverCheckIn();
+    while (deliveries->deliverRun()) {
     }
   });
 }
 
 ActivityDeliveries::ActivityDeliveries(ScheduleCriteria criteria, const StateDirectory& state,
                                        const DeferralConditions& conditions, ServiceStatus& status,
-                                       Clock& clock, ActivityHandler handler)
+                                       Clock& clock, Threads& threads, ActivityHandler handler)
     : criteria_(criteria),
       state_(state),
       conditions_(conditions),
       status_(status),
       clock_(clock),
+      threads_(threads),
       handler_(std::move(handler)),
       putOffByMachine_(state.putOff()) {}
 
@@ -341,7 +344,7 @@ std::optional<Date> ActivityDeliveries::waitUntilDue() {
         waitForRun(seen, clock_.now(), *criteria_.interval, timeSince(begin, clock_));
     if (remaining.count() == 0) return seen;
     status_.say("waiting until the next run is due");
-    wait(std::min(remaining, kLongestWait));
+    threads_.sleep(std::min(remaining, kLongestWait));
   }
 }
 
@@ -366,14 +369,8 @@ void ActivityDeliveries::waitFor(std::chrono::nanoseconds duration) {
   for (;;) {
     const std::chrono::nanoseconds remaining = duration - timeSince(begin, clock_);
     if (remaining.count() <= 0) return;
-    wait(std::min(remaining, kLongestWait));
+    threads_.sleep(std::min(remaining, kLongestWait));
   }
-}
-
-void ActivityDeliveries::wait(std::chrono::nanoseconds duration) {
-  // Nobody signals the semaphore, so this only sleeps, by a clock that tests can move.
-  Semaphore never(0);
-  clock_.wait(never, duration);
 }
 
 }  // namespace tessel

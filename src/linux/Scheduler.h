@@ -107,7 +107,7 @@ class BackgroundScheduler final : public ActivityScheduler {
  public:
   BackgroundScheduler(ScheduleCriteria criteria, const StateDirectory& state,
                       const DeferralConditions& conditions, ServiceRuntime& runtime,
-                      ServiceStatus& status, Clock& clock);
+                      ServiceStatus& status, Clock& clock, Threads& threads);
 
   // REQUIRES: called once.
   void registerActivity(const std::string& name, ActivityHandler handler) override;
@@ -119,6 +119,7 @@ class BackgroundScheduler final : public ActivityScheduler {
   ServiceRuntime& runtime_;
   ServiceStatus& status_;
   Clock& clock_;
+  Threads& threads_;
 };
 
 // What the scheduler's thread does, step by step. Threads: one at a time.
@@ -126,7 +127,7 @@ class ActivityDeliveries {
  public:
   ActivityDeliveries(ScheduleCriteria criteria, const StateDirectory& state,
                      const DeferralConditions& conditions, ServiceStatus& status, Clock& clock,
-                     ActivityHandler handler);
+                     Threads& threads, ActivityHandler handler);
 
   void deliverCheckIn();
   // Waits until a run is due and no other process runs, and delivers it. False if no further
@@ -145,13 +146,13 @@ class ActivityDeliveries {
   bool machineMayDefer() const { return putOffByMachine_ < criteria_.deferLimit; }
   void warnOnce(DeferReason reason);
   void waitFor(std::chrono::nanoseconds duration);
-  void wait(std::chrono::nanoseconds duration);
 
   const ScheduleCriteria criteria_;
   const StateDirectory& state_;
   const DeferralConditions& conditions_;
   ServiceStatus& status_;
   Clock& clock_;
+  Threads& threads_;
   const ActivityHandler handler_;
   std::optional<Date> lastRunHere_;  // the last run of this process; recording it may have failed
   // How long battery and pressure have put off the run that is due. It includes what earlier

@@ -143,17 +143,19 @@ void deliverForEver(int signalNumber, const std::shared_ptr<SerialQueue>& queue,
 
 }  // namespace
 
-ThreadSignalSource::ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue)
-    : signalNumber_(signalNumber), queue_(std::move(queue)) {}
+ThreadSignalSource::ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue,
+                                       Threads& threads)
+    : signalNumber_(signalNumber), queue_(std::move(queue)), threads_(threads) {}
 
 void ThreadSignalSource::setHandler(Closure handler) { handler_ = std::move(handler); }
 
 void ThreadSignalSource::resume() {
   if (!queue_) return;
   TESSEL_INVARIANT(handler_ != nullptr);
-  startThread(
-      [number = signalNumber_, queue = std::exchange(queue_, nullptr),
-       handler = std::exchange(handler_, nullptr)] { deliverForEver(number, queue, handler); });
+  startThread(threads_, [number = signalNumber_, queue = std::exchange(queue_, nullptr),
+                         handler = std::exchange(handler_, nullptr)] {
+    deliverForEver(number, queue, handler);
+  });
 }
 
 // Holds one of the runtime's two counters up by one for as long as it lives.
@@ -171,7 +173,7 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
     // too early would end it in the middle of a run.
     TESSEL_INVARIANT(counter_ > 0);
     --counter_;
-    runtime_.changed_.notify_all();
+    runtime_.changed_.signal();
   }
 
  private:
@@ -179,7 +181,8 @@ class ServiceRuntime::Hold final : public KeepAliveTransaction {
   size_t& counter_;
 };
 
-ServiceRuntime::ServiceRuntime(ServiceManager& manager) : manager_(manager) {}
+ServiceRuntime::ServiceRuntime(ServiceManager& manager, Threads& threads)
+    : manager_(manager), threads_(threads) {}
 
 std::unique_ptr<KeepAliveTransaction> ServiceRuntime::openTransaction(const std::string& /*name*/) {
   // From here on the work itself must send the signs of life. After this call it has at least three
@@ -195,12 +198,12 @@ std::unique_ptr<KeepAliveTransaction> ServiceRuntime::expectDelivery() {
 void ServiceRuntime::requestCleanExit() {
   const std::lock_guard lock(mutex_);
   cleanExitRequested_ = true;
-  changed_.notify_all();
+  changed_.signal();
 }
 
 std::shared_ptr<SignalSource> ServiceRuntime::makeSignalSource(int signalNumber,
                                                                std::shared_ptr<SerialQueue> queue) {
-  return std::make_shared<ThreadSignalSource>(signalNumber, std::move(queue));
+  return std::make_shared<ThreadSignalSource>(signalNumber, std::move(queue), threads_);
 }
 
 bool ServiceRuntime::mayExit() const {
@@ -217,15 +220,13 @@ bool ServiceRuntime::exitAllowed() const {
 void ServiceRuntime::waitUntilExitAllowed() {
   const std::chrono::nanoseconds feedInterval = manager_.feedInterval();
   std::unique_lock lock(mutex_);
-  if (feedInterval.count() == 0) {
-    changed_.wait(lock, [this] { return exitAllowed(); });
-    return;
-  }
-  while (!changed_.wait_for(lock, transactions_ > 0 ? feedInterval / 2 : feedInterval,
-                            [this] { return exitAllowed(); })) {
+  while (!exitAllowed()) {
     const bool working = transactions_ > 0;
     lock.unlock();
-    working ? manager_.standInForProgress() : manager_.progress();
+    const std::chrono::nanoseconds patience = working ? feedInterval / 2 : feedInterval;
+    const bool changed =
+        threads_.wait(changed_, feedInterval.count() == 0 ? Threads::kForEver : patience);
+    if (!changed) working ? manager_.standInForProgress() : manager_.progress();
     lock.lock();
   }
 }

@@ -4,7 +4,6 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -76,7 +75,7 @@ class ThreadSignalSource final : public SignalSource {
  public:
   // REQUIRES: `signalNumber` is blocked in every thread of the process. Call blockSignal() before
   // the first thread starts.
-  ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue);
+  ThreadSignalSource(int signalNumber, std::shared_ptr<SerialQueue> queue, Threads& threads);
 
   void setHandler(Closure handler) override;
   // Starts the delivery. A second call does nothing. REQUIRES: a handler is set.
@@ -85,6 +84,7 @@ class ThreadSignalSource final : public SignalSource {
  private:
   const int signalNumber_;
   std::shared_ptr<SerialQueue> queue_;
+  Threads& threads_;
   Closure handler_;
 };
 
@@ -93,8 +93,8 @@ class ThreadSignalSource final : public SignalSource {
 // The runtime outlives every transaction, so it lives as long as the process.
 class ServiceRuntime final : public Runtime {
  public:
-  // `manager` must outlive the runtime.
-  explicit ServiceRuntime(ServiceManager& manager);
+  // `manager` and `threads` must outlive the runtime.
+  ServiceRuntime(ServiceManager& manager, Threads& threads);
 
   std::unique_ptr<KeepAliveTransaction> openTransaction(const std::string& name) override;
   void requestCleanExit() override;
@@ -119,8 +119,9 @@ class ServiceRuntime final : public Runtime {
   bool exitAllowed() const;
 
   ServiceManager& manager_;
+  Threads& threads_;
   mutable std::mutex mutex_;
-  std::condition_variable changed_;
+  Semaphore changed_{0};  // has a unit for each change that the main loop has not looked at yet
   size_t transactions_ = 0;
   size_t deliveries_ = 0;
   bool cleanExitRequested_ = false;

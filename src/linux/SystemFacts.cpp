@@ -17,7 +17,6 @@
 #include <ctime>
 #include <memory>
 #include <sstream>
-#include <thread>
 #include <utility>
 
 #include "os/Files.h"
@@ -34,14 +33,6 @@ uint64_t SystemClock::continuousTicks() {
 
 Date SystemClock::now() {
   return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
-}
-
-void SystemClock::sleepMicroseconds(uint32_t microseconds) {
-  std::this_thread::sleep_for(std::chrono::microseconds{microseconds});
-}
-
-bool SystemClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
-  return semaphore.waitFor(timeout);
 }
 
 Boot thisBoot() {

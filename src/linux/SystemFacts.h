@@ -23,8 +23,6 @@ class SystemClock final : public Clock {
   uint64_t continuousTicks() override;
   Timebase timebase() override { return {1, 1}; }
   Date now() override;
-  void sleepMicroseconds(uint32_t microseconds) override;
-  bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
 };
 
 // The boot that this machine is in. Any thread.

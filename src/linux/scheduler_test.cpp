@@ -141,6 +141,7 @@ class ActivityDeliveriesTest : public StateDirectoryTest {
             conditions_,
             status_,
             clock_,
+            clock_,
             [this](const std::shared_ptr<Activity>& activity) {
               begins_.push_back(clock_.now());
               states_.push_back(activity->state());
@@ -178,7 +179,7 @@ TEST_F(ActivityDeliveriesTest, OneRunFollowsTheCheckIn) {
   once.deliverCheckIn();
   EXPECT_FALSE(once.deliverRun());
   EXPECT_THAT(states_, ElementsAre(0, 2));
-  EXPECT_TRUE(clock_.waits.empty());
+  EXPECT_TRUE(clock_.sleeps.empty());
 }
 
 TEST_F(ActivityDeliveriesTest, RunsAreAnIntervalApart) {
@@ -341,7 +342,7 @@ TEST_F(ActivityDeliveriesTest, TwoProcessesRunOnce) {
   std::optional<RunLock> first = state_.tryLock();
   const Date start = clock_.now();
   ActivityDeliveries second(
-      {hours{24}, seconds{900}}, state_, conditions_, status, clock_,
+      {hours{24}, seconds{900}}, state_, conditions_, status, clock_, clock_,
       [&](const std::shared_ptr<Activity>&) { begins_.push_back(clock_.now()); });
   std::thread thread([&] { second.deliverRun(); });
   EXPECT_TRUE(status.waitsForOther.waitFor(seconds{30}));
@@ -353,8 +354,8 @@ TEST_F(ActivityDeliveriesTest, TwoProcessesRunOnce) {
 
 TEST_F(ActivityDeliveriesTest, ADeliveryHoldsTheProcess) {
   ServiceManager manager(clock_, [](const std::string&) {}, {});
-  ServiceRuntime runtime(manager);
-  BackgroundScheduler scheduler({}, state_, conditions_, runtime, manager, clock_);
+  ServiceRuntime runtime(manager, clock_);
+  BackgroundScheduler scheduler({}, state_, conditions_, runtime, manager, clock_, clock_);
   Semaphore mayRun(0);
   Semaphore ran(0);
   runtime.requestCleanExit();

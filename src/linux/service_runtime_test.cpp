@@ -65,7 +65,8 @@ class ServiceRuntimeTest : public ::testing::Test {
  protected:
   FakeClock clock_;
   ServiceManager manager_{clock_, [](const std::string&) {}, {}};
-  ServiceRuntime runtime_{manager_};
+  Threads& threads_ = testing::realThreads();
+  ServiceRuntime runtime_{manager_, threads_};
 };
 
 TEST_F(ServiceRuntimeTest, ATransactionHoldsTheProcess) {
@@ -96,7 +97,7 @@ class ProcessEndTest : public ServiceRuntimeTest {
 TEST_F(ProcessEndTest, TheLastTransactionEndsTheLoop) {
   EXPECT_EXIT(
       {
-        WorkerQueue queue("test");
+        WorkerQueue queue("test", threads_);
         auto transaction = std::make_shared<std::unique_ptr<KeepAliveTransaction>>(
             runtime_.openTransaction("work"));
         queue.async([this, transaction] {
@@ -113,12 +114,12 @@ TEST_F(ProcessEndTest, AnEarlyInterruptIsDelivered) {
       {
         prepareProcess();
         ::kill(::getpid(), SIGINT);
-        WorkerQueue working("other work");
+        WorkerQueue working("other work", threads_);
         std::atomic<int> turns{0};
         working.async([&turns] {
           for (;;) ++turns;
         });
-        const auto queue = std::make_shared<WorkerQueue>("interrupts");
+        const auto queue = std::make_shared<WorkerQueue>("interrupts", threads_);
         const auto source = runtime_.makeSignalSource(SIGINT, queue);
         source->setHandler([] { std::exit(0); });
         source->resume();
@@ -132,8 +133,8 @@ TEST_F(ProcessEndTest, AnIgnoredInterruptStillEndsIt) {
       {
         std::signal(SIGINT, SIG_IGN);
         prepareProcess();
-        const auto source =
-            runtime_.makeSignalSource(SIGINT, std::make_shared<WorkerQueue>("interrupts"));
+        const auto source = runtime_.makeSignalSource(
+            SIGINT, std::make_shared<WorkerQueue>("interrupts", threads_));
         source->setHandler([] { std::exit(0); });
         source->resume();
         ::kill(::getpid(), SIGINT);

@@ -42,7 +42,7 @@ void Throttle::sleepForRestOfQuantum(double elapsedMicroseconds) {
   if (!(elapsedMicroseconds < quantum)) return;
   const auto sleep = static_cast<uint32_t>(quantum - elapsedMicroseconds);
   tesselReporterLog().debug("Sleeping for %u us", sleep);
-  clock_.sleepMicroseconds(sleep);
+  threads_.sleep(std::chrono::microseconds{sleep});
   throttledMicroseconds_ += sleep;
   ++throttledCount_;
 }

@@ -88,7 +88,7 @@ class Throttle {
  public:
   static constexpr std::chrono::microseconds kTimeOfAStep{12'500};
 
-  explicit Throttle(Clock& clock) : clock_(clock) {}
+  Throttle(Clock& clock, Threads& threads) : clock_(clock), threads_(threads) {}
 
   // Takes one step. Sleeps on the caller's thread if the sends go too fast.
   void throttleReportedEvent();
@@ -110,6 +110,7 @@ class Throttle {
   void sleepForRestOfQuantum(double elapsedMicroseconds);
 
   Clock& clock_;
+  Threads& threads_;
   std::once_flag firstUse_;
   double microsecondsPerMachUnit_ = 0;
   float quantumMicroseconds_ = 0;

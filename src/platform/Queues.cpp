@@ -19,7 +19,7 @@
 // closures that sleep (the throttle) or that wait for an event which never comes.
 //
 // So exit(0) may meet threads that are still running. The C library then destroys the objects with
-// static storage while those threads go on. Whatever they touch (Threads, TimerThread, the sink of
+// static storage while those threads go on. Whatever they touch (the pool, TimerThread, the sink of
 // the log) is made by `new` and never deleted, and a thread shares the state of the queue that it
 // works on. An unfinished closure ends with the process. That does no harm: the spool keeps every
 // row that it has taken, and a run leaves its marker.
@@ -28,15 +28,10 @@
 
 #include <algorithm>
 #include <atomic>
-#include <condition_variable>
 #include <deque>
 #include <list>
-#include <mutex>
 #include <queue>
-#include <system_error>
-#include <thread>
 #include <utility>
-#include <vector>
 
 #include "platform/Invariant.h"
 
@@ -54,83 +49,72 @@ constexpr std::chrono::milliseconds kIdleThreadLife{20};
 // second cost nothing.
 constexpr std::chrono::milliseconds kThreadRetry{100};
 
-// True on the threads of the pool.
-thread_local bool onPoolThread = false;
-
-// False if the system has no thread to give.
-bool tryStartThread(const Closure& body) {
-  try {
-    std::thread(body).detach();
-    return true;
-  } catch (const std::system_error&) {
-    return false;
-  }
-}
-
 }  // namespace
 
-void startThread(const Closure& body) {
-  while (!tryStartThread(body)) std::this_thread::sleep_for(kThreadRetry);
+void startThread(Threads& threads, const Closure& body) {
+  while (!threads.start(body)) threads.sleep(kThreadRetry);
 }
 
-bool startThread(const Closure& body, std::chrono::milliseconds patience) {
-  for (auto waited = std::chrono::milliseconds{0}; !tryStartThread(body); waited += kThreadRetry) {
+bool startThread(Threads& threads, const Closure& body, std::chrono::milliseconds patience) {
+  for (auto waited = std::chrono::milliseconds{0}; !threads.start(body); waited += kThreadRetry) {
     if (waited >= patience) return false;
-    std::this_thread::sleep_for(kThreadRetry);
+    threads.sleep(kThreadRetry);
   }
   return true;
 }
 
+// What a thread needs of the queue that it works on. They share it.
 struct WorkerQueue::State {
-  State(std::string name, QueueThread thread)
+  State(std::string name, Threads& threadsIn, ThreadPool::Members* poolIn)
       : label(std::move(name)),
-        arrived(thread == QueueThread::own ? new std::condition_variable : nullptr) {}
+        threads(threadsIn),
+        pool(poolIn),
+        arrived(pool == nullptr ? new Semaphore(0) : nullptr) {}
 
   const std::string label;
   std::mutex mutex;
   std::list<Closure> work;  // a list, because an empty one has nothing on the heap
-  // Wakes the queue's own thread. Absent on the queues that share the pool: a process that stays
+  Threads& threads;
+  ThreadPool::Members* const pool;  // absent if the queue has a thread of its own
+  // Wakes the queue's own thread. Absent on the queues that share a pool: a process that stays
   // keeps a queue of each past run, and this would be a tenth of its memory.
-  const std::unique_ptr<std::condition_variable> arrived;
-  bool hasThread = false;  // a thread of the pool works on it or will do so soon
+  const std::unique_ptr<Semaphore> arrived;
+  bool hasThread = false;  // a thread works on it or will do so soon
   bool working = false;    // a closure is running
   bool dropped = false;    // nobody can submit any more
 };
 
 // The threads that queues share.
-class WorkerQueue::Threads {
+class ThreadPool::Members {
  public:
-  static Threads& shared() {
-    static Threads& instance = *new Threads;
-    return instance;
+  explicit Members(Threads& threads) : system_(threads) {
+    startThread(system_, [this] { run(); });
   }
 
-  void take(std::shared_ptr<State> queue) {
+  Threads& system() { return system_; }
+
+  void take(std::shared_ptr<WorkerQueue::State> queue) {
     const std::lock_guard lock(mutex_);
     waiting_.push_back(std::move(queue));
     if (idle_ >= waiting_.size()) {
-      arrived_.notify_one();
+      arrived_.signal();
     } else if (threads_ < kMostPoolThreads) {
       // We hold the lock until the thread is detached. detach() reads memory that a thread gives
       // back when it ends, and this thread needs the lock before it can end. If there is no thread
       // to be had, the queue waits for those that exist.
-      if (tryStartThread([this] { run(); })) ++threads_;
+      if (system_.start([this] { run(); })) ++threads_;
     }
   }
 
  private:
-  Threads() {
-    startThread([this] { run(); });
-  }
-
   void run() {
-    onPoolThread = true;
+    ownsThisThread() = true;
     std::unique_lock lock(mutex_);
     while (waitForQueue(lock)) {
-      const std::shared_ptr<State> queue = std::move(waiting_.front());
+      const std::shared_ptr<WorkerQueue::State> queue = std::move(waiting_.front());
       waiting_.pop_front();
       lock.unlock();
-      drain(*queue);
+      WorkerQueue::drain(*queue);
       lock.lock();
     }
     --threads_;
@@ -142,43 +126,47 @@ class WorkerQueue::Threads {
     ++idle_;
     bool timedOut = false;
     while (waiting_.empty() && !(timedOut && threads_ > 1)) {
-      if (threads_ == 1) {
-        arrived_.wait(lock);
-      } else {
-        timedOut = arrived_.wait_for(lock, kIdleThreadLife) == std::cv_status::timeout;
-      }
+      const bool last = threads_ == 1;
+      lock.unlock();
+      timedOut = !system_.wait(arrived_, last ? Threads::kForEver : kIdleThreadLife);
+      lock.lock();
     }
     --idle_;
     return !waiting_.empty();
   }
 
-  // `hasThread` lets only one thread into a queue, which makes it serial.
-  static void drain(State& queue) {
-    std::unique_lock lock(queue.mutex);
-    runAll(queue, lock);
-    queue.hasThread = false;
-  }
-
+  Threads& system_;
   std::mutex mutex_;
-  std::condition_variable arrived_;
-  std::deque<std::shared_ptr<State>> waiting_;
+  // May have a unit for a queue that is taken already. Its taker then finds nothing and waits on.
+  Semaphore arrived_{0};
+  std::deque<std::shared_ptr<WorkerQueue::State>> waiting_;
   size_t idle_ = 0;
   size_t threads_ = 1;
 };
 
-WorkerQueue::WorkerQueue(std::string label, QueueThread thread)
-    : state_(std::make_shared<State>(std::move(label), thread)) {
-  if (thread == QueueThread::own) startThread([state = state_] { serve(*state); });
+// Never deleted: its threads use it.
+ThreadPool::ThreadPool(Threads& threads) : members_(*new Members(threads)) {}
+
+bool& ThreadPool::ownsThisThread() {
+  thread_local bool owns = false;
+  return owns;
+}
+
+WorkerQueue::WorkerQueue(std::string label, ThreadPool& pool)
+    : state_(std::make_shared<State>(std::move(label), pool.members_.system(), &pool.members_)) {}
+
+WorkerQueue::WorkerQueue(std::string label, Threads& threads)
+    : state_(std::make_shared<State>(std::move(label), threads, nullptr)) {
+  state_->hasThread = true;
+  startThread(threads, [state = state_] { serve(*state); });
 }
 
 WorkerQueue::~WorkerQueue() {
   if (!state_->arrived) return;
   const std::lock_guard lock(state_->mutex);
   state_->dropped = true;
-  state_->arrived->notify_one();
+  state_->arrived->signal();
 }
-
-void WorkerQueue::startPool() { Threads::shared(); }
 
 const std::string& WorkerQueue::label() const { return state_->label; }
 
@@ -186,22 +174,22 @@ void WorkerQueue::async(Closure work) {
   {
     const std::lock_guard lock(state_->mutex);
     state_->work.push_back(std::move(work));
-    if (state_->arrived) return state_->arrived->notify_one();
     if (std::exchange(state_->hasThread, true)) return;
+    if (state_->arrived) return state_->arrived->signal();
   }
-  Threads::shared().take(state_);
+  state_->pool->take(state_);
 }
 
 void WorkerQueue::sync(const Closure& work) {
   // If closures of the pool waited for other queues, they could hold all threads of the pool, and
   // what they wait for would never run.
-  TESSEL_INVARIANT(!onPoolThread);
+  TESSEL_INVARIANT(!ThreadPool::ownsThisThread());
   Semaphore done(0);
   async([&work, &done] {
     work();
     done.signal();
   });
-  while (!done.waitFor(std::chrono::hours(1))) {
+  while (!state_->threads.wait(done, Threads::kForEver)) {
   }
 }
 
@@ -211,12 +199,21 @@ void WorkerQueue::serve(State& state) {
   for (;;) {
     runAll(state, lock);
     if (state.dropped) return;
-    state.arrived->wait(lock);
+    lock.unlock();
+    state.threads.wait(*state.arrived, Threads::kForEver);
+    lock.lock();
   }
 }
 
+// The work of a thread of the pool.
+void WorkerQueue::drain(State& state) {
+  std::unique_lock lock(state.mutex);
+  runAll(state, lock);
+}
+
 // Runs everything that the queue holds. async() promises that each closure is destroyed right after
-// it ran, so this does it before the next one begins. REQUIRES: `lock` holds the queue's mutex.
+// it ran, so this does it before the next one begins. `hasThread` lets only one thread in, which
+// makes the queue serial. REQUIRES: `lock` holds the queue's mutex.
 void WorkerQueue::runAll(State& state, std::unique_lock<std::mutex>& lock) {
   while (!state.work.empty()) {
     Closure work = std::move(state.work.front());
@@ -230,11 +227,10 @@ void WorkerQueue::runAll(State& state, std::unique_lock<std::mutex>& lock) {
     lock.lock();
     state.working = false;
   }
+  state.hasThread = false;
 }
 
 namespace {
-
-using TimePoint = std::chrono::steady_clock::time_point;
 
 struct TimerRecord {
   std::shared_ptr<SerialQueue> queue;
@@ -245,44 +241,40 @@ struct TimerRecord {
 
 // `timer` lives as long as the process, as the timer does.
 struct Firing {
-  TimePoint due;
+  std::chrono::nanoseconds due;  // by Threads::time()
   TimerRecord* timer;
   bool operator<(const Firing& other) const { return due > other.due; }
 };
 
+}  // namespace
+
 // The one thread that submits the handlers of all timers when they are due. It never runs a handler
 // itself, so a slow handler delays no other timer. It lives as long as the process.
-class TimerThread {
+class WorkerQueueFactory::TimerThread {
  public:
-  static TimerThread& shared() {
-    static TimerThread& instance = *new TimerThread;
-    return instance;
+  explicit TimerThread(Threads& threads) : threads_(threads) {
+    startThread(threads_, [this] { run(); });
   }
 
   void add(std::unique_ptr<TimerRecord> timer) {
     const std::lock_guard lock(mutex_);
-    firings_.push({std::chrono::steady_clock::now(), timer.release()});
-    changed_.notify_one();
+    firings_.push({threads_.time(), timer.release()});
+    changed_.signal();
   }
 
  private:
-  TimerThread() {
-    startThread([this] { run(); });
-  }
-
   void run() {
     std::unique_lock lock(mutex_);
     for (;;) {
-      if (firings_.empty()) {
-        changed_.wait(lock);
+      const std::chrono::nanoseconds now = threads_.time();
+      const auto due = firings_.empty() ? now + Threads::kForEver : firings_.top().due;
+      if (due > now) {
+        lock.unlock();
+        threads_.wait(changed_, due - now);
+        lock.lock();
         continue;
       }
       Firing next = firings_.top();
-      const TimePoint now = std::chrono::steady_clock::now();
-      if (next.due > now) {
-        changed_.wait_until(lock, next.due);
-        continue;
-      }
       firings_.pop();
       // A process that was stopped for a while must not fire once for each interval that it missed.
       // It fires at most once more at once, and then goes on from now.
@@ -304,39 +296,40 @@ class TimerThread {
     });
   }
 
+  Threads& threads_;
   std::mutex mutex_;
-  std::condition_variable changed_;
+  Semaphore changed_{0};
   std::priority_queue<Firing> firings_;
 };
 
-class SharedThreadTimer final : public RepeatingTimer {
+class WorkerQueueFactory::SharedThreadTimer final : public RepeatingTimer {
  public:
-  explicit SharedThreadTimer(std::unique_ptr<TimerRecord> record) : record_(std::move(record)) {}
+  SharedThreadTimer(TimerThread& timers, std::unique_ptr<TimerRecord> record)
+      : timers_(timers), record_(std::move(record)) {}
   void resume() override {
-    if (record_) TimerThread::shared().add(std::move(record_));
+    if (record_) timers_.add(std::move(record_));
   }
 
  private:
+  TimerThread& timers_;
   std::unique_ptr<TimerRecord> record_;
 };
 
-}  // namespace
-
-WorkerQueueFactory::WorkerQueueFactory() {
-  WorkerQueue::startPool();
-  TimerThread::shared();
-}
+// The thread of the timers is never deleted: it uses itself.
+WorkerQueueFactory::WorkerQueueFactory(Threads& threads)
+    : pool_(threads), timers_(*new TimerThread(threads)) {}
 
 std::shared_ptr<SerialQueue> WorkerQueueFactory::makeSerialQueue(std::string label) {
-  return std::make_shared<WorkerQueue>(std::move(label));
+  return std::make_shared<WorkerQueue>(std::move(label), pool_);
 }
 
 std::shared_ptr<RepeatingTimer> WorkerQueueFactory::makeRepeatingTimer(
     std::shared_ptr<SerialQueue> queue, std::chrono::nanoseconds interval,
     std::chrono::nanoseconds /*leeway*/, Closure handler) {
   // The leeway lets a firing be late. Ours come on time, so it is not needed.
-  return std::make_shared<SharedThreadTimer>(std::unique_ptr<TimerRecord>(
-      new TimerRecord{std::move(queue), interval, std::move(handler)}));
+  return std::make_shared<SharedThreadTimer>(
+      timers_, std::unique_ptr<TimerRecord>(
+                   new TimerRecord{std::move(queue), interval, std::move(handler)}));
 }
 
 }  // namespace tessel

@@ -32,9 +32,6 @@ class Clock {
   virtual uint64_t continuousTicks() = 0;
   virtual Timebase timebase() = 0;
   virtual Date now() = 0;
-  virtual void sleepMicroseconds(uint32_t microseconds) = 0;
-  // Waits on `semaphore`. False if `timeout` passed first.
-  virtual bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) = 0;
 };
 
 struct FileExistence {

@@ -9,14 +9,18 @@
 #include <vector>
 
 #include "platform/Queues.h"
+#include "platform/testing/Fakes.h"
 
 namespace tessel {
 namespace {
 
+using testing::realThreads;
+
 TEST(WorkerQueueTest, RunsOneAtATimeInOrder) {
   constexpr size_t kThreads = 4;
   constexpr int kEach = 500;
-  WorkerQueue queue("test");
+  ThreadPool pool(realThreads());
+  WorkerQueue queue("test", pool);
   std::vector<std::vector<int>> orders(kThreads);  // written by the queue alone
   int count = 0;
   std::vector<std::thread> threads;
@@ -40,7 +44,8 @@ TEST(WorkerQueueTest, RunsOneAtATimeInOrder) {
 TEST(WorkerQueueTest, ADroppedQueueRunsWhatItHolds) {
   const auto done = std::make_shared<Semaphore>(0);
   {
-    WorkerQueue queue("test");
+    ThreadPool pool(realThreads());
+    WorkerQueue queue("test", pool);
     queue.async([done] { done->signal(); });
   }
   EXPECT_TRUE(done->waitFor(std::chrono::seconds(30)));
@@ -70,11 +75,12 @@ TEST(WorkerQueueTest, QueuesShareEightThreadsAndOwnOnesDoNotWait) {
   constexpr int kQueues = 30;
   constexpr int kThreads = 8;
   const auto gate = std::make_shared<Gate>();
-  for (int i = 0; i < kQueues; ++i) WorkerQueue("shared").async([gate] { gate->pass(); });
+  ThreadPool pool(realThreads());
+  for (int i = 0; i < kQueues; ++i) WorkerQueue("shared", pool).async([gate] { gate->pass(); });
   for (int i = 0; i < kThreads; ++i) ASSERT_TRUE(gate->entered.waitFor(std::chrono::seconds(30)));
   EXPECT_FALSE(gate->entered.waitFor(std::chrono::milliseconds(50))) << "a ninth thread";
   bool ran = false;
-  WorkerQueue("own", QueueThread::own).sync([&ran] { ran = true; });
+  WorkerQueue("own", realThreads()).sync([&ran] { ran = true; });
   EXPECT_TRUE(ran);
   for (int i = 0; i < kQueues; ++i) gate->open.signal();
   for (int i = 0; i < kQueues; ++i) EXPECT_TRUE(gate->left.waitFor(std::chrono::seconds(30)));
@@ -85,9 +91,10 @@ TEST(WorkerQueueDeathTest, ASharedThreadMayNotWaitForAnotherQueue) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(
       {
-        WorkerQueue other("other");
+        ThreadPool pool(realThreads());
+        WorkerQueue other("other", pool);
         Semaphore never(0);
-        WorkerQueue("shared").async([&other] { other.sync([] {}); });
+        WorkerQueue("shared", pool).async([&other] { other.sync([] {}); });
         never.waitFor(std::chrono::seconds(30));
       },
       "broken invariant at Queues.cpp");
@@ -108,7 +115,7 @@ struct StuckQueue final : SerialQueue {
 };
 
 TEST(RepeatingTimerTest, AFiringThatStillWaitsIsNotRepeated) {
-  WorkerQueueFactory factory;
+  WorkerQueueFactory factory(realThreads());
   const auto queue = std::make_shared<StuckQueue>();
   const std::chrono::milliseconds often(1);
   factory.makeRepeatingTimer(queue, often, often, [] {})->resume();
@@ -119,7 +126,7 @@ TEST(RepeatingTimerTest, AFiringThatStillWaitsIsNotRepeated) {
 }
 
 TEST(RepeatingTimerTest, FiresAtOnceAndOutlivesItsOwner) {
-  WorkerQueueFactory factory;
+  WorkerQueueFactory factory(realThreads());
   const auto fired = std::make_shared<Semaphore>(0);
   {
     const auto timer =

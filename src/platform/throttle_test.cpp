@@ -19,7 +19,7 @@ class ThrottleTest : public ::testing::Test {
 
   testing::RecordingLog log;
   testing::FakeClock clock;
-  Throttle throttle{clock};
+  Throttle throttle{clock, clock};
 };
 
 TEST_F(ThrottleTest, TheTenthStepSleepsToTheQuantumsEnd) {
@@ -61,7 +61,7 @@ TEST(ThrottleTimebaseTest, TicksCountInTheClocksOwnUnit) {
   testing::RecordingLog log;
   testing::FakeClock clock;
   clock.base = {125, 3};
-  Throttle throttle(clock);
+  Throttle throttle(clock, clock);
   for (int i = 0; i < 9; ++i) throttle.throttleReportedEvent();
   clock.ticks += 1'200'000;  // 50,000 us
   throttle.throttleReportedEvent();

@@ -117,8 +117,8 @@ RunBook bookOfRuns(const LaunchConfiguration& launch, const StateDirectory& stat
 // Makes the parts that take an object from the store to the spool.
 TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& variant, Spool& spool,
                           QueueFactory& queues, SerialQueue& reportingQueue, Clock& clock,
-                          ServiceStatus& status) {
-  auto& throttle = keep<Throttle>(clock);
+                          Threads& threads, ServiceStatus& status) {
+  auto& throttle = keep<Throttle>(clock, threads);
   auto& road = keep<EventRoad>(throttle, spool, reportingQueue);
   auto& volumes = keep<MountTable>();
   auto& identity = keep<ProcessIdentity>(keep<AppBundles>(volumes));
@@ -150,16 +150,17 @@ TraceReading& makeReading(const LaunchConfiguration& launch, BuildVariant& varia
 }
 
 ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& state, Clock& clock,
-                      ServiceStatus& status, SerialQueue& reportingQueue) {
-  auto& queues = keep<WorkerQueueFactory>();
+                      Threads& threads, ServiceStatus& status, SerialQueue& reportingQueue) {
+  auto& queues = keep<WorkerQueueFactory>(threads);
   auto& variant = keep<OsReleaseBuildVariant>(launch.osReleasePath);
-  auto& configurations = keep<FileConfigurationService>(launch.configurationDirectory);
-  auto& gate = keep<TaskingGate>(variant, configurations, queues, clock);
+  auto& configurations = keep<FileConfigurationService>(launch.configurationDirectory, threads);
+  auto& gate = keep<TaskingGate>(variant, configurations, queues, threads);
   const auto writerQueue =
-      std::make_shared<WorkerQueue>("tessel_reporter spool writer queue", QueueThread::own);
+      std::make_shared<WorkerQueue>("tessel_reporter spool writer queue", threads);
   const SpoolLimits limits{launch.spoolLimitBytes, launch.spoolDays};
   auto& spool = keep<Spool>(state.path(), limits, clock, status, writerQueue, queues);
-  auto& reading = makeReading(launch, variant, spool, queues, reportingQueue, clock, status);
+  auto& reading =
+      makeReading(launch, variant, spool, queues, reportingQueue, clock, threads, status);
   return keep<ReportingRun>(gate, keep<CookieFile>(keep<LocalFiles>()), reading, clock, status,
                             bookOfRuns(launch, state, spool, reportingQueue));
 }
@@ -173,24 +174,24 @@ ReportingRun& makeRun(const LaunchConfiguration& launch, const StateDirectory& s
     platformLog().warning("A file in the state directory is not used: %@", refused.words);
 
   auto& clock = keep<SystemClock>();
+  auto& threads = keep<StandardThreads>();
   ServiceManager& manager = *connectServiceManager(clock).release();
-  auto& runtime = keep<ServiceRuntime>(manager);
+  auto& runtime = keep<ServiceRuntime>(manager, threads);
   const auto processingQueue =
-      std::make_shared<WorkerQueue>("tessel_reporter processing queue", QueueThread::own);
-  auto& reportingQueue =
-      keep<WorkerQueue>("tessel_reporter Statora reporting queue", QueueThread::own);
+      std::make_shared<WorkerQueue>("tessel_reporter processing queue", threads);
+  auto& reportingQueue = keep<WorkerQueue>("tessel_reporter Statora reporting queue", threads);
   const auto interruptSource = runtime.makeSignalSource(SIGINT, processingQueue);
   // SIGINT ends the process at once, even in the middle of a run. That run leaves its marker, so
   // the next run bails out.
   interruptSource->setHandler([] { std::exit(0); });
 
-  auto& activity =
-      keep<ReporterActivity>(runtime, makeRun(launch, state, clock, manager, reportingQueue));
+  auto& activity = keep<ReporterActivity>(
+      runtime, makeRun(launch, state, clock, threads, manager, reportingQueue));
   auto& conditions = keep<DeferralConditions>(launch.deferOn, state.deferFile());
   auto& scheduler =
       keep<BackgroundScheduler>(ScheduleCriteria{launch.activityInterval, launch.deferRetry,
                                                  launch.runLimit, launch.deferLimit},
-                                state, conditions, runtime, manager, clock);
+                                state, conditions, runtime, manager, clock, threads);
   scheduler.registerActivity(kActivityName, [&activity](const std::shared_ptr<Activity>& changed) {
     activity.handleActivity(changed);
   });

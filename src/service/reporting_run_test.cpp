@@ -56,7 +56,7 @@ class RunTest : public ::testing::Test {
 
   TaskingGate gate{variant, configurations, queues, clock};
   CookieFile cookie{files};
-  Throttle throttle{clock};
+  Throttle throttle{clock, clock};
   ProcessIdentity identity{bundles};
   RunSummary summary{sender, throttle, clock, dates, status};
   EventRoad road{throttle, sender, reportingQueue};

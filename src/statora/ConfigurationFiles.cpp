@@ -21,7 +21,6 @@
 #include <cerrno>
 #include <chrono>
 #include <filesystem>
-#include <thread>
 #include <utility>
 
 #include "os/Files.h"
@@ -155,7 +154,8 @@ struct Watch {
 class FileObserver final : public ConfigurationObserver,
                            public std::enable_shared_from_this<FileObserver> {
  public:
-  explicit FileObserver(std::string directory) : directory_(std::move(directory)) {}
+  FileObserver(std::string directory, Threads& threads)
+      : directory_(std::move(directory)), threads_(threads) {}
   FileObserver(const FileObserver&) = delete;
   FileObserver& operator=(const FileObserver&) = delete;
   ~FileObserver() override {
@@ -176,7 +176,7 @@ class FileObserver final : public ConfigurationObserver,
       observe(*watch, observer);
     };
     // Without a thread the delegate is never called. That is no word on the configuration.
-    if (!startThread(watching, kPatienceForAThread))
+    if (!startThread(threads_, watching, kPatienceForAThread))
       sayBlind(*watch_, {ErrorCode::failed, "there is no thread for it"});
   }
 
@@ -220,6 +220,7 @@ class FileObserver final : public ConfigurationObserver,
   }
 
   const std::string directory_;
+  Threads& threads_;
   std::shared_ptr<ConfigurationObserverDelegate> delegate_;
   std::shared_ptr<SerialQueue> queue_;
   std::shared_ptr<Watch> watch_;
@@ -228,7 +229,7 @@ class FileObserver final : public ConfigurationObserver,
 }  // namespace
 
 std::shared_ptr<ConfigurationObserver> FileConfigurationService::makeObserver() {
-  return std::make_shared<FileObserver>(directory_);
+  return std::make_shared<FileObserver>(directory_, threads_);
 }
 
 }  // namespace tessel

@@ -12,6 +12,7 @@
 
 #include "platform/Analytics.h"
 #include "platform/Error.h"
+#include "platform/Threads.h"
 
 namespace tessel {
 
@@ -89,13 +90,15 @@ class FileConfigurationService final : public ConfigurationService {
  public:
   static constexpr size_t kMaxFileBytes = size_t{1} << 20;
 
-  // `directory` need not exist.
-  explicit FileConfigurationService(std::string directory) : directory_(std::move(directory)) {}
+  // `directory` need not exist. REQUIRES: `threads` outlives the observers.
+  FileConfigurationService(std::string directory, Threads& threads)
+      : directory_(std::move(directory)), threads_(threads) {}
 
   std::shared_ptr<ConfigurationObserver> makeObserver() override;
 
  private:
   const std::string directory_;
+  Threads& threads_;
 };
 
 }  // namespace tessel

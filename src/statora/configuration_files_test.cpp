@@ -10,6 +10,7 @@
 
 #include "os/testing/TemporaryDirectory.h"
 #include "platform/Queues.h"
+#include "platform/testing/Fakes.h"
 #include "statora/ConfigurationFiles.h"
 
 namespace tessel {
@@ -200,7 +201,7 @@ class FileConfigurationServiceTest : public ::testing::Test {
 
   void observe() { observe(directory_.path()); }
   void observe(const std::string& directory) {
-    observer_ = FileConfigurationService(directory).makeObserver();
+    observer_ = FileConfigurationService(directory, testing::realThreads()).makeObserver();
     observer_->setDelegate(delegate_, queue_);
     observer_->startObserving(kType);
   }
@@ -211,7 +212,8 @@ class FileConfigurationServiceTest : public ::testing::Test {
 
   TemporaryDirectory directory_;
   std::shared_ptr<RecordingDelegate> delegate_ = std::make_shared<RecordingDelegate>();
-  std::shared_ptr<WorkerQueue> queue_ = std::make_shared<WorkerQueue>("test");
+  std::shared_ptr<WorkerQueue> queue_ =
+      std::make_shared<WorkerQueue>("test", testing::realThreads());
   std::shared_ptr<ConfigurationObserver> observer_;
 };
 

@@ -32,10 +32,6 @@ struct SlowClock final : Clock {
   }
   Timebase timebase() override { return clock.timebase(); }
   Date now() override { return clock.now(); }
-  void sleepMicroseconds(uint32_t microseconds) override { clock.sleepMicroseconds(microseconds); }
-  bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override {
-    return clock.wait(semaphore, timeout);
-  }
   testing::FakeClock& clock;
 };
 

@@ -196,9 +196,10 @@ TEST_F(SpoolTest, RowsWaitForALockUntilTheRunEnds) {
 }
 
 TEST_F(SpoolTest, ThreadsLoseNoRow) {
-  WorkerQueueFactory timers;
+  Threads& threads = testing::realThreads();
+  WorkerQueueFactory timers(threads);
   Spool spool(directory_.path(), {}, clock_, status_,
-              std::make_shared<WorkerQueue>("writer", QueueThread::own), timers);
+              std::make_shared<WorkerQueue>("writer", threads), timers);
   for (int run = 1; run <= 20; ++run) {
     for (int i = 0; i < 200; ++i) spool.sendEvent("a", numbered(i), EventRank::object);
     EXPECT_EQ(spool.endRun().stored, 200u);

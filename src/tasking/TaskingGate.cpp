@@ -135,7 +135,7 @@ TaskingDecision TaskingGate::awaitTaskingConfiguration() {
                             }),
                         queue);
   observer->startObserving(kTaskingType);
-  if (!clock_.wait(answer->arrived, kConfigurationWait))
+  if (!threads_.wait(answer->arrived, kConfigurationWait))
     return {observer->blind() ? TaskingReason::notLookedAt : TaskingReason::noneArrived};
   return answer->decision;
 }

@@ -72,11 +72,11 @@ TaskingDecision taskingDecisionForTaskedOnValue(const ConfigurationValue* value)
 class TaskingGate {
  public:
   TaskingGate(BuildVariant& buildVariant, ConfigurationService& configurations,
-              QueueFactory& queues, Clock& clock)
+              QueueFactory& queues, Threads& threads)
       : buildVariant_(buildVariant),
         configurations_(configurations),
         queues_(queues),
-        clock_(clock) {}
+        threads_(threads) {}
 
   // Blocks the caller for at most 5 seconds.
   TaskingDecision decide();
@@ -88,7 +88,7 @@ class TaskingGate {
   BuildVariant& buildVariant_;
   ConfigurationService& configurations_;
   QueueFactory& queues_;
-  Clock& clock_;
+  Threads& threads_;
 };
 
 // Hands configuration changes to a closure. The closure, and what it captured, lives for as long as

@@ -192,7 +192,7 @@ TEST_F(SharesTest, programsAreSharedOutWhereTheyMayBeReported) {
 // A service that takes two steps and some bytes for each object that is called "reported".
 TEST_F(SharesTest, timeAndTextCostTheirWriter) {
   testing::FakeClock clock;
-  Throttle throttle(clock);
+  Throttle throttle(clock, clock);
   Spending spending;
   const auto startCharged = [&](uint64_t seconds, uint64_t rowBytes) {
     startAfresh();

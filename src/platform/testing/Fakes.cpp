@@ -33,20 +33,30 @@ void RecordingLog::clear() {
   lines_.clear();
 }
 
+Threads& realThreads() {
+  static Threads& threads = *new StandardThreads;
+  return threads;
+}
+
 void FakeClock::advance(std::chrono::nanoseconds by) {
   ticks += static_cast<uint64_t>(by.count()) * base.denominator / base.numerator;
   date += std::chrono::duration_cast<std::chrono::microseconds>(by);
 }
 
-void FakeClock::sleepMicroseconds(uint32_t microseconds) {
-  sleeps.push_back(microseconds);
-  advance(std::chrono::microseconds{microseconds});
+void FakeClock::sleep(std::chrono::nanoseconds time) {
+  sleeps.push_back(static_cast<uint32_t>(time / std::chrono::microseconds{1}));
+  if (whileWaiting) whileWaiting();
+  advance(time);
+}
+
+std::chrono::nanoseconds FakeClock::time() {
+  return std::chrono::nanoseconds{static_cast<int64_t>(ticks * base.numerator / base.denominator)};
 }
 
 bool FakeClock::wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) {
   waits.push_back(timeout);
   if (whileWaiting) whileWaiting();
-  if (semaphore.waitFor(std::chrono::nanoseconds{0})) return true;
+  if (semaphore.tryTake()) return true;
   advance(timeout);
   return false;
 }

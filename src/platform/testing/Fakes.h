@@ -38,21 +38,28 @@ class RecordingLog final : public LogSink {
   std::vector<std::pair<LogLevel, std::string>> lines_;
 };
 
+// Real threads. Never destroyed, because the threads of pools and timers outlive every test.
+Threads& realThreads();
+
 // A clock in nanosecond ticks that moves only when told to, by a sleep or by a wait that times out.
-class FakeClock final : public Clock {
+// Both are its own, so it is the role of threads as well. What it starts is a real thread.
+class FakeClock final : public Clock, public Threads {
  public:
   uint64_t continuousTicks() override { return ticks; }
   Timebase timebase() override { return base; }
   Date now() override { return date; }
-  void sleepMicroseconds(uint32_t microseconds) override;
-  // Runs `whileWaiting`, then advances by the whole timeout where nothing was signalled.
+  bool start(const Closure& body) override { return realThreads().start(body); }
+  void sleep(std::chrono::nanoseconds time) override;
+  std::chrono::nanoseconds time() override;
+  // Runs `whileWaiting`, as sleep() does, then advances by the whole timeout where nothing was
+  // signalled.
   bool wait(Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
   void advance(std::chrono::nanoseconds by);
 
   uint64_t ticks = 1'000'000'000;
   Timebase base{1, 1};
   Date date{std::chrono::seconds{1'795'000'000}};
-  std::vector<uint32_t> sleeps;
+  std::vector<uint32_t> sleeps;  // microseconds
   std::vector<std::chrono::nanoseconds> waits;
   Closure whileWaiting;
 };
