@@ -231,10 +231,14 @@ void ServiceRuntime::waitUntilExitAllowed() {
   }
 }
 
-void ServiceRuntime::runMainLoop() {
+void ServiceRuntime::serve() {
   manager_.ready();
   waitUntilExitAllowed();
   manager_.stopping();
+}
+
+void ServiceRuntime::runMainLoop() {
+  serve();
   std::exit(0);
 }
 

@@ -105,6 +105,8 @@ class ServiceRuntime final : public Runtime {
   // transaction is open, this loop sends the signs of life. While one is open, its work sends them,
   // and this loop only stands in: otherwise a run that hangs would look alive.
   [[noreturn]] void runMainLoop() override;
+  // The same, but returns when the process may end.
+  void serve();
 
   // Keeps the process alive until the result is destroyed, because a delivery is pending. Unlike a
   // transaction it does not mean that work is under way.

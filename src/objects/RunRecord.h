@@ -1,7 +1,7 @@
 // RunRecord: the result of one run, with all its counts.
 //
-// The run fills it, and main.cpp adds what became of the spool's rows and of the run marker. It is
-// then kept as `<state>/last_run.json`; each run replaces the record of the run before.
+// The run fills it, and the composition adds what became of the spool's rows and of the run marker.
+// It is then kept as `<state>/last_run.json`; each run replaces the record of the run before.
 //
 // RunNote: begin and end of a run. The note is written before the run begins, so a run that dies
 // leaves one without an end. The file keeps the notes of the last runs beside the record.
