@@ -15,8 +15,20 @@ inside() {
         env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin HOME=/root TERM=dumb DEBIAN_FRONTEND=noninteractive "$@"
 }
 
+# The control groups of a container are below those of the process that starts it. Two containers that are
+# started from the same ones would share the group of each service.
+cgroup=tessel-trial-$$
+cgroup_trees() { find /sys/fs/cgroup /sys/fs/cgroup/systemd /sys/fs/cgroup/unified -maxdepth 1 -name cgroup.procs -printf '%h\n' 2> /dev/null | sort -u; }
+in_own_cgroup() {
+    for tree in $(cgroup_trees); do
+        mkdir -p "$tree/$cgroup"
+        echo 0 > "$tree/$cgroup/cgroup.procs"
+    done
+    exec "$@"
+}
+
 boot() {
-    systemd-nspawn --quiet --boot --register=no --keep-unit --directory="$root" --machine=tessel-trial \
+    in_own_cgroup systemd-nspawn --quiet --boot --register=no --keep-unit --directory="$root" --machine=tessel-trial \
         --resolv-conf=replace-host > "$trial/console" 2>&1 < /dev/null &
     nspawn=$!
     for _ in $(seq 300); do
@@ -37,6 +49,7 @@ power_off() {
     if [ "$nspawn" ]; then wait "$nspawn" 2> /dev/null || true; fi
     leader=
     nspawn=
+    for tree in $(cgroup_trees); do find "$tree/$cgroup" -depth -type d -exec rmdir {} + 2> /dev/null || true; done
 }
 
 # --- Checks ---------------------------------------------------------------------------------------
