@@ -61,7 +61,9 @@ endif()
 
 # The same bytes wherever it is built, and no path of that machine in them. The last that fits counts, and
 # the build directory most often lies in that of the sources.
-add_compile_options("$<${shipped}:-ffile-prefix-map=${PROJECT_SOURCE_DIR}/=;-ffile-prefix-map=${PROJECT_BINARY_DIR}=build>")
+set(no_paths "$<${shipped}:-ffile-prefix-map=${PROJECT_SOURCE_DIR}/=;-ffile-prefix-map=${PROJECT_BINARY_DIR}=build>")
+add_compile_options("${no_paths}")
+add_link_options("${no_paths}")  # what is optimised at link time is compiled there
 
 # The programs parse files that anybody can write: a mistake in them is to end the program, not to serve
 # an attacker. Sanitizers see more, and do not go with fortified functions.
