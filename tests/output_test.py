@@ -137,6 +137,29 @@ class Terminals(OutputTest):
                                     (("report", "--html", "-"), rf"[\s\S]*<p>{period} &middot;[\s\S]*made this page on {stamp} {name} ")):
                 self.assertRegex(self.machine.ctl(*arguments, TZ=zone).out, "^" + head)
 
+    def test_two_rows_of_a_repeated_hour_differ(self):
+        instants = [1792888200 + 3600 * hour for hour in range(3)]  # 0:30, 1:30 and 2:30 UTC of October 25, 2026
+        self.machine.now = instants[0]
+        self.machine.write_export([point("event", "com.vantor.Clock", "Show", "Hand", at=at - instants[0]) for at in instants])
+        self.add_rows(*((int(at * 1e6), "clock", "{}") for at in instants))
+        berlin = {"TZ": "CET-1CEST,M3.5.0,M10.5.0/3", "NO_COLOR": "1"}
+        for since in ("2026-10-25", "2026-10-25 01:00"):
+            _, out = self.on_terminal("explain", "--since", since, "--until", "2026-10-25 04:00", **berlin)
+            self.assertEqual(re.findall(r"(?m)^.*\b(0\d:30:00(?: \w+)?) +reported +event +com", out), ["02:30:00 CEST", "02:30:00 CET", "03:30:00"])
+        self.assertRegex(self.on_terminal("events", "-n", "3", **berlin)[1], r"(?s) 02:30:00 CEST  waits .* 02:30:00 CET  waits .* 03:30:00  waits ")
+        page = self.machine.ctl("report", "--since", "2026-10-25 01:00", "--until", "2026-10-25 05:00", "--html", "-", **berlin).out
+        for column in ("10-25 02:30 CEST", "10-25 02:30 CET", "10-25 03:30"):
+            self.assertIn(column + "<", page)
+
+    def test_an_unknown_zone_is_said_once(self):
+        commands = [("explain",), ("events",), ("status",), ("compare", "last=1h", "until=-1h"), ("report", "--html", "-")]
+        for arguments in commands:
+            result = self.machine.ctl(*arguments, TZ="Europe/Nowhere")
+            self.assertEqual(result.errors.count("$TZ: 'Europe/Nowhere' is no time zone"), 1, result.errors)
+            self.assertNotRegex(result.out, r"\d Europe\b")
+        for zone in ("", "UTC", ":Asia/Tokyo", "/usr/share/zoneinfo/Asia/Tokyo", "CET-1CEST,M3.5.0,M10.5.0/3", "<+0330>-3:30"):
+            self.assertNotIn("TZ", self.machine.ctl("explain", TZ=zone).errors, zone)
+
     def test_lines_fit_80_columns_and_the_terminal(self):
         for columns in (80, 60):
             for arguments in (("explain",), ("explain", "--summary"), ("status",), ("events",),

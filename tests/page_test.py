@@ -114,6 +114,11 @@ class Figures(PageTest):
             self.assertEqual(page.run(f"[...document.querySelectorAll('#findings .{kind} li')].map(item => item.firstChild.textContent)"),
                              [finding["code"] for finding in status[kind]])
         self.assertIsNone(self.open(self.make("--store", self.machine.store)).run("document.querySelector('#findings')"))
+        tasking = "document.querySelector('#tasking')"
+        self.assertIsNone(page.run(tasking))
+        self.machine.task('{"TaskedOn": false}')
+        self.assertRegex(self.open(self.make()).run(tasking + ".textContent"), f"^Reporting is off. {self.machine.config}/.* says so. ")
+        self.assertRegex(self.open(self.make("--without-values")).run(tasking + ".textContent"), '^Reporting is off. "Reported" tells')
 
 
 class Hostile(PageTest):

@@ -71,14 +71,16 @@ class LastRun(StatusTest):
         damaged, refused = (os.path.join(self.machine.store, name) for name in ("b.export", "c.journal"))
         with open(damaged, "wb") as file:
             file.write(b"no equals sign\n\n")
+        self.machine.write_export([log_event("much later", at=-20)], "d.export", first_sequence=100)
         self.service()
         self.assertEqual(self.problems(), {"store_damaged": None})
+        self.assertEqual([note["code"] for note in self.status()["notes"]], ["numbers_in_no_file"])
         os.rename(damaged, refused)
         self.service()
         self.assertEqual(self.problems(), {"store_unreadable": None})
         os.unlink(refused)
         self.service()
-        self.assertEqual(self.problems(), {})
+        self.assertEqual((self.problems(), self.status()["notes"]), ({}, []), "numbers without a loss beside them tell nothing")
 
     def test_expired_rows_count_once_a_forwarder_delivered(self):
         old = lambda: self.spool("INSERT INTO events(time, name, payload) VALUES(1, 'x', '{}')")
@@ -100,22 +102,24 @@ class LastRun(StatusTest):
         self.assertEqual((self.problems(), self.machine.record()["end"]), ({"rows_expired": None}, before["end"]))
 
     def test_what_anybody_can_cause_is_a_note(self):
-        self.machine.write_export(some_points(1) + [Entry([("TESSEL_KIND", "event")], at=-50)])
-        self.machine.write_export([Entry([("_TRANSPORT", "driver"), ("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"),
-                                          ("N_DROPPED", "7")], at=-30)], "b.export", first_sequence=10)
-        self.service()
-        status = self.status()
-        self.assertEqual([note["code"] for note in status["notes"]],
-                         ["dropped_by_daemon", "malformed", "store_begins_late"])
-        self.assertTrue(status["good"])
+        old = log_event("old", at=-90000)
+        bad = Entry([("TESSEL_KIND", "event")], at=-50)
+        dropped = Entry([("_TRANSPORT", "driver"), ("MESSAGE_ID", "a596d6fe7bfa4994828e72309e95d61e"), ("N_DROPPED", "7")], at=-30)
+        lost = Entry([("TESSEL_LOST", "5"), ("TESSEL_LOST_SINCE", str(int((self.machine.now - 60) * 1e6)))], uid=1000)
+        begins = [point("begin", "com.vantor.A", "B", interval=at, attributes=[("a", "b")] * 32) for at in range(8200)]
+        for entries, *codes in (([old, lost], "lost_at_source"), ([old, dropped], "dropped_by_daemon"), ([old, *begins], "over_share"),
+                                ([old, bad], "malformed"), ([log_event("young")], "store_begins_late")):
+            self.machine.write_export(entries)
+            self.service()
+            status = self.status()
+            self.assertEqual(([note["code"] for note in status["notes"]], status["good"]), (codes, True))
+            self.machine.write_export([old] + some_points(1))
+            self.service()
+            self.assertEqual(self.status()["notes"], [], codes)
         self.change_record(lambda record: record.update(outcome="interrupted"))
-        self.assertIn("run_cut_short", [note["code"] for note in self.status()["notes"]])
+        self.assertEqual([note["code"] for note in self.status()["notes"]], ["run_cut_short"])
         text = self.call("tesselctl", "status").out
-        self.assertLess(text.index("malformed "), text.index("All in all"))
-        os.unlink(os.path.join(self.machine.store, "b.export"))
-        self.machine.write_export([log_event("old", at=-90000)] + some_points(1))
-        self.service()
-        self.assertEqual(self.status()["notes"], [])
+        self.assertLess(text.index("run_cut_short "), text.index("All in all"))
 
 
 class Runs(StatusTest):

@@ -141,22 +141,35 @@ std::string replaceInvalidUtf8(std::string_view text) {
   return out;
 }
 
-// A backslash stays as it is, because escaped text is for people. A reader who must tell a recorded
-// backslash from one of ours takes the JSON output.
-std::string terminalText(std::string_view text) {
+namespace {
+
+// A terminal and a page must hide the same characters, or a name could pass on one of them. So
+// this is the one place that says which characters are replaced, and `replace(out, character)` says
+// only by what.
+template <typename Replace>
+std::string withoutObeyed(std::string_view text, Replace&& replace) {
   std::string out;
+  out.reserve(text.size());
   appendEscaped(
       out, text,
       [](const Character& character) { return character.valid && !isObeyed(character.point); },
-      [&](const Character& character) {
-        if (!character.valid || isControl(character.point))
-          appendByteEscapes(out, character.bytes);
-        else if (character.point > 0xffff)
-          appendHex(out += "\\U", character.point, 8);
-        else
-          appendUnicodeEscape(out, character.point);
-      });
+      [&](const Character& character) { replace(out, character); });
   return out;
+}
+
+}  // namespace
+
+// A backslash stays as it is, because escaped text is for people. A reader who must tell a recorded
+// backslash from one of ours takes the JSON output.
+std::string terminalText(std::string_view text) {
+  return withoutObeyed(text, [](std::string& out, const Character& character) {
+    if (!character.valid || isControl(character.point))
+      appendByteEscapes(out, character.bytes);
+    else if (character.point > 0xffff)
+      appendHex(out += "\\U", character.point, 8);
+    else
+      appendUnicodeEscape(out, character.point);
+  });
 }
 
 // Logs keep characters that reorder a line: the languages that are written from right to left need
@@ -198,22 +211,16 @@ std::string shortPlainText(std::string_view text, size_t maximum) {
 // so we show their numbers.
 std::string visibleText(std::string_view text) {
   constexpr char32_t kControlPictures = 0x2400;
-  std::string out;
-  out.reserve(text.size());
-  appendEscaped(
-      out, text,
-      [](const Character& character) { return character.valid && !isObeyed(character.point); },
-      [&](const Character& character) {
-        if (!character.valid) {
-          out += kReplacementCharacter;
-        } else if (character.point < 0x20) {
-          const char32_t picture = kControlPictures + character.point;
-          out += {'\xe2', '\x90', static_cast<char>(0x80 | (picture & 0x3f))};
-        } else {
-          appendNumber(out, character.point);
-        }
-      });
-  return out;
+  return withoutObeyed(text, [](std::string& out, const Character& character) {
+    if (!character.valid) {
+      out += kReplacementCharacter;
+    } else if (character.point < 0x20) {
+      const char32_t picture = kControlPictures + character.point;
+      out += {'\xe2', '\x90', static_cast<char>(0x80 | (picture & 0x3f))};
+    } else {
+      appendNumber(out, character.point);
+    }
+  });
 }
 
 std::string htmlText(std::string_view text) {

@@ -9,6 +9,7 @@
 #include "linux/SystemFacts.h"
 #include "platform/Text.h"
 #include "tasking/TaskingGate.h"
+#include "tesselctl/reading/TimeZone.h"
 #include "whitelist/PlatformProfile.h"
 
 namespace tessel::ctl {
@@ -102,6 +103,13 @@ std::optional<Surroundings> lookAround(const Invocation& invocation) {
                                                              : ColourChoice::automatic;
   return Surroundings{std::get<LaunchConfiguration>(std::move(launch)), SystemClock().now(),
                       terminalBehind(STDOUT_FILENO, choice)};
+}
+
+void checkZone() {
+  if (const auto unknown = replaceUnknownZone()) {
+    printError("tesselctl: $TZ: '" + terminalText(*unknown) +
+               "' is no time zone that is known here; dates are read and shown in UTC\n");
+  }
 }
 
 // The option stands before a command and behind it, since users of other tools try both. The help

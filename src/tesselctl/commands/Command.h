@@ -47,6 +47,10 @@ struct Surroundings {
 // nothing.
 std::optional<Surroundings> lookAround(const Invocation& invocation);
 
+// Says on stderr that $TZ names no zone, if so; local time is UTC from then on. Each command that
+// reads or shows dates begins with it.
+void checkZone();
+
 // --- Adding a command.
 
 // Makes `command` call `run` and store its exit status in `invocation`. `command` shares the

@@ -179,6 +179,7 @@ std::string comparisonText(const Comparison& comparison, const std::string& head
 }
 
 int runCompare(const CompareOptions& options, const Surroundings& surroundings) {
+  checkZone();
   const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   const auto a = settingOf(options.settings[0], *reading, surroundings.now);

@@ -225,6 +225,7 @@ int showEvent(const EventsOptions& options, const Surroundings& surroundings) {
 }
 
 int runEvents(const EventsOptions& options, const Surroundings& surroundings) {
+  checkZone();
   if (options.id) return showEvent(options, surroundings);
   std::optional<Period> period;
   if (options.period.given()) {

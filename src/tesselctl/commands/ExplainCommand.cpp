@@ -142,8 +142,7 @@ class ExplainRun {
     }
     // A store that the command line names may be a copy from elsewhere.
     const Tasking tasking = askTasking(launch_);
-    if (!options_.reading.store && !tasking.decision.on() &&
-        tasking.decision.source() != TaskingSource::unknown &&
+    if (!options_.reading.store && tasking.isOff() &&
         tally_.verdicts()[TesselReporterClassificationTelemetryReported] != 0) {
       say("Reporting is off on this machine: " + terminalText(taskingWords(tasking, launch_)) +
           ". 'reported' tells what a run would report if it were on.");
@@ -215,6 +214,7 @@ class ExplainRun {
 };
 
 int runExplain(const ExplainOptions& options, const Surroundings& surroundings) {
+  checkZone();
   const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   if (options.follow && (options.summary || options.reading.period.given())) {

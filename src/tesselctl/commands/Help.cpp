@@ -50,7 +50,9 @@ constexpr std::array<std::pair<std::string_view, std::string_view>, 13> kVariabl
     {"TESSEL_TRACE", "0: record nothing; check: say on standard error what is wrong"},
     {"TESSEL_TRACE_WAIT", "milliseconds to wait for room in the journal's socket [20]"},
     {"TESSEL_JOURNAL_SOCKET", "socket of the journal [/run/systemd/journal/socket]"},
-    {"TZ", "time zone of the dates that are read and shown [the machine's]"},
+    {"TZ",
+     "time zone of the dates that are read and shown; one that is unknown counts as UTC, and "
+     "standard error says so [the machine's]"},
     {"COLUMNS", "width of the output, 1 to 9999 [the terminal's]"},
     {"NO_COLOR", "if not empty, no colours"},
 }};

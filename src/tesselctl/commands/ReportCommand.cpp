@@ -57,6 +57,7 @@ int makeReport(const ReportOptions& options, const Reading& reading, const Repor
 }
 
 int runReport(const ReportOptions& options, const Surroundings& surroundings) {
+  checkZone();
   auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   ReportFacts facts{machineName(),
@@ -68,11 +69,15 @@ int runReport(const ReportOptions& options, const Surroundings& surroundings) {
                     surroundings.now,
                     {},
                     {},
+                    {},
                     options.withoutValues};
   // A store that the command line names may be a copy from elsewhere. The state of this machine
   // then says nothing about it.
-  if (!options.reading.store)
-    facts.findings = gatherStatus(surroundings.launch, surroundings.now).findings;
+  if (!options.reading.store) {
+    ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
+    facts.findings = std::move(status.findings);
+    if (status.tasking.isOff()) facts.reportingIsOff = status.taskingWords;
+  }
   if (options.lastRun) {
     if (options.reading.period.given()) return fail(kUsage, "--last-run has a period of its own");
     const std::string& directory = surroundings.launch.stateDirectory;

@@ -215,6 +215,7 @@ std::optional<PlatformError> writeFiles(const StatusOptions& options,
 }
 
 int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
+  checkZone();
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
   const bool toFiles = options.save || options.prometheus;
   if (options.json || !toFiles)

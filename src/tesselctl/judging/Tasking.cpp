@@ -34,7 +34,10 @@ Tasking askTasking(const LaunchConfiguration& launch) {
     const auto configuration = found.text ? parseConfiguration(*found.text) : nullptr;
     return taskingDecisionForConfiguration(configuration.get(), kTaskingType);
   });
-  Tasking tasking{decision, failure, file, readRollout(launch), {}};
+  // The service reads the file as another user. Without this a good file would be called bad.
+  const bool unreadable =
+      decision.source() == TaskingSource::unusable && ::access(file.c_str(), R_OK) != 0;
+  Tasking tasking{decision, failure, file, readRollout(launch), {}, unreadable};
   if (tasking.rollout) tasking.place = placeOf(machineId().value_or(""), tasking.rollout->cohort);
   return tasking;
 }
@@ -61,9 +64,7 @@ std::string sourceWords(const Tasking& tasking, const LaunchConfiguration& launc
     case TaskingSource::unusable:
       break;
   }
-  // The service may read the file as another user. Without this line we would call a good file bad.
-  if (::access(tasking.file.c_str(), R_OK) != 0)
-    return tasking.file + " may not be read by this user";
+  if (tasking.unreadable) return tasking.file + " may not be read by this user";
   return tasking.file + " does not hold a JSON object with a number or boolean under \"TaskedOn\"";
 }
 

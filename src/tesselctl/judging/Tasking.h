@@ -21,6 +21,12 @@ struct Tasking {
   std::optional<Rollout> rollout;  // the last that decided; absent if none did
   std::optional<uint32_t> place;   // of this machine in it; absent if it has no machine id
 
+  bool unreadable = false;  // this user may not read the file; the service perhaps may
+
+  // Whether it is known that the machine reports nothing.
+  bool isOff() const {
+    return !decision.on() && decision.source() != TaskingSource::unknown && !unreadable;
+  }
   bool inShare() const { return rollout && place && *place < rollout->share; }
 };
 

@@ -9,6 +9,7 @@
 
 #include "platform/Text.h"
 #include "tesselctl/reading/Scanner.h"
+#include "tesselctl/reading/TimeZone.h"
 
 namespace tessel::ctl {
 
@@ -81,6 +82,12 @@ std::string formatted(Date date, const char* format) {
   return {text, std::strftime(text, sizeof text, format, &parts)};
 }
 
+// " CEST" where clocks show the time of `date` twice, else nothing.
+std::string zoneIfTwice(Date date) {
+  const TimeZone local = TimeZone::local();
+  return local.readings(local.wallTime(date)).size() > 1 ? formatted(date, " %Z") : "";
+}
+
 }  // namespace
 
 // "999999999999w" would overflow and give a wrong duration. So we check each part before we
@@ -117,14 +124,14 @@ DateResult parseDate(std::string_view text, Date now) {
   return parseCalendar(text, now);
 }
 
-std::string dateText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S"); }
-std::string timeOfDayText(Date date) { return formatted(date, "%H:%M:%S"); }
+std::string dateText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S") + zoneIfTwice(date); }
+std::string timeOfDayText(Date date) { return formatted(date, "%H:%M:%S") + zoneIfTwice(date); }
 std::string zonedText(Date date) { return formatted(date, "%Y-%m-%d %H:%M:%S %Z"); }
 
 std::string periodText(const Period& period) {
   const bool oneZone = formatted(period.start, "%Z") == formatted(period.end, "%Z");
-  return (oneZone ? dateText(period.start) : zonedText(period.start)) + " to " +
-         zonedText(period.end);
+  return (oneZone ? formatted(period.start, "%Y-%m-%d %H:%M:%S") : zonedText(period.start)) +
+         " to " + zonedText(period.end);
 }
 
 // With the distance from UTC two stamps of the hour that repeats when summer time ends are told

@@ -30,11 +30,12 @@ DateResult parseDate(std::string_view text, Date now);
 // Nothing if `text` is no duration, or one of zero or of more than a thousand years.
 std::optional<std::chrono::microseconds> parseDuration(std::string_view text);
 
-// "2026-11-22 21:45:01", local time.
+// "2026-11-22 21:45:01", local time. In an hour that clocks show twice the zone stands behind it,
+// "2026-10-25 02:30:00 CEST", because nothing else tells the two apart.
 std::string dateText(Date date);
 // "2026-11-22T21:45:01.250000+01:00", local time and its distance from UTC. parseDate() reads it.
 std::string stampText(Date date);
-// "21:45:01", local time.
+// "21:45:01", local time, with the zone as dateText().
 std::string timeOfDayText(Date date);
 // "2026-11-22 21:45:01 CET", local time.
 std::string zonedText(Date date);

@@ -46,6 +46,32 @@ class OtherZone {
   std::optional<std::string> usual_;
 };
 
+bool isZoneFile(const std::string& path) {
+  std::ifstream file(path, std::ios::binary);
+  std::array<char, 4> magic{};
+  return file.read(magic.data(), magic.size()) &&
+         std::string_view(magic.data(), magic.size()) == "TZif";
+}
+
+// UTC is known without the database, which a small machine may lack.
+bool isUtc(std::string_view name) {
+  return name == "UTC" || name == "GMT" || name == "utc" || name == "Z";
+}
+
+// Whether the text begins like a rule of POSIX: a name of three letters or more, or any name in
+// angle brackets, and the distance from UTC. "CET-1CEST,M3.5.0,M10.5.0/3" is one.
+bool isRule(std::string_view text) {
+  const auto isLetter = [](char c) { return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z'); };
+  const size_t name =
+      text.starts_with('<')
+          ? text.find('>') + 1
+          : static_cast<size_t>(std::ranges::find_if_not(text, isLetter) - text.begin());
+  if (name < 3) return false;
+  text.remove_prefix(name);
+  if (text.starts_with('+') || text.starts_with('-')) text.remove_prefix(1);
+  return !text.empty() && text.front() >= '0' && text.front() <= '9';
+}
+
 // The C library takes any text for a zone and answers UTC for one that it does not know. So we look
 // at the file ourselves.
 bool inDatabase(std::string_view name) {
@@ -58,10 +84,7 @@ bool inDatabase(std::string_view name) {
   const char* directory = std::getenv("TZDIR");
   const std::string folder =
       directory != nullptr && *directory != '\0' ? directory : "/usr/share/zoneinfo";
-  std::ifstream file(folder + "/" + std::string(name), std::ios::binary);
-  std::array<char, 4> magic{};
-  return file.read(magic.data(), magic.size()) &&
-         std::string_view(magic.data(), magic.size()) == "TZif";
+  return isZoneFile(folder + "/" + std::string(name));
 }
 
 }  // namespace
@@ -72,9 +95,8 @@ TimeZone TimeZone::fixed(seconds fromUtc) {
   return zone;
 }
 
-// UTC is known without the database, which a small machine may lack.
 std::optional<TimeZone> TimeZone::named(std::string_view name) {
-  if (name == "UTC" || name == "GMT" || name == "utc" || name == "Z") return fixed(seconds{0});
+  if (isUtc(name)) return fixed(seconds{0});
   if (!inDatabase(name)) return {};
   TimeZone zone;
   zone.name_ = name;
@@ -122,6 +144,19 @@ bool TimeZone::uses(std::string_view offsetName, Date date) const {
     if (at(date + week * std::chrono::hours{7 * 24}).name == offsetName) return true;
   }
   return false;
+}
+
+// An empty $TZ is UTC by the rules of POSIX. A colon before a name of the database means nothing.
+std::optional<std::string> replaceUnknownZone() {
+  const char* value = std::getenv("TZ");
+  std::string_view name = value == nullptr ? "" : value;
+  if (name.starts_with(':')) name.remove_prefix(1);
+  const bool file = name.starts_with('/') && isZoneFile(std::string(name));
+  if (name.empty() || file || isUtc(name) || inDatabase(name) || isRule(name)) return {};
+  std::string unknown = value;
+  ::setenv("TZ", "UTC0", 1);
+  ::tzset();
+  return unknown;
 }
 
 std::string offsetText(seconds fromUtc) {

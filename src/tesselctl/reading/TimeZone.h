@@ -52,6 +52,10 @@ class TimeZone {
   std::string name_;  // empty: the zone of $TZ or of the machine
 };
 
+// What $TZ says, if it names no zone; local time is UTC from then on. The C library would count it
+// as UTC, too, but without a word and under a made-up name.
+std::optional<std::string> replaceUnknownZone();
+
 // "+01:00"
 std::string offsetText(std::chrono::seconds fromUtc);
 

@@ -81,13 +81,13 @@ std::string shownValue(const Style& style, float value, const Terminal& terminal
   return terminal.interactive ? style.text(value) : plainDigits(value);
 }
 
-std::string heading(const Style& style, const Terminal& terminal) {
-  const std::string unit = terminal.interactive ? "" : std::string(" in ") + style.unit;
-  // QuantileSketch::kError. What people read is a rule for their eyes: a difference below it means
-  // nothing.
-  static_assert(QuantileSketch::kError < 0.016);
-  return "\n" + terminal.paint(Colour::strong, style.title + unit) +
-         ": a percentile may be off by 1.6 % of its value, the rest is exact\n";
+// `exactness` is what holds for the figures beside the percentiles.
+std::string heading(const Style& style, const char* exactness, const Terminal& terminal) {
+  const std::string title =
+      style.title + (terminal.interactive ? std::string() : std::string(" in ") + style.unit);
+  std::string line = wrapped(title + ": " + kPercentileError + exactness, terminal.width, 2) + "\n";
+  // Painted behind the wrapping, which would count the sequences of colours as columns.
+  return "\n" + line.replace(0, title.size(), terminal.paint(Colour::strong, title));
 }
 
 std::string upper(std::string text) {
@@ -150,7 +150,7 @@ std::string quantileTable(const Style& style, const Durations& durations,
   out += remainder(shown, rows.size(), durations.notListed(style.measure));
   if (negative != 0)
     out += "  " + counted(negative, "negative value", "negative values") + " left out\n";
-  return out.empty() ? "" : heading(style, terminal) + out;
+  return out.empty() ? "" : heading(style, "; the rest is exact", terminal) + out;
 }
 
 using Verdict = DurationChange::Verdict;
@@ -251,7 +251,9 @@ std::string changesText(const Style& style, const Durations& a, const Durations&
   const uint64_t further = a.notListed(style.measure) + b.notListed(style.measure);
   const auto changes = changesBetween(a, b, style.measure);
   if (changes.empty() && further == 0) return "";
-  std::string out = heading(style, terminal);
+  // A factor divides two percentiles, so their errors meet.
+  static_assert((1 + QuantileSketch::kError) / (1 - QuantileSketch::kError) < 1.032);
+  std::string out = heading(style, ", a factor 3.2 %; the rest is exact", terminal);
   out += "  " + wrapped(verdictCounts(changes), terminal.width, 2) + "\n";
   if (!terminal.interactive)
     return out + changeTable(style, changes, terminal) + remainder(0, 0, further);

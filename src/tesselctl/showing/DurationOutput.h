@@ -20,6 +20,11 @@ std::string frameRateText(float rate);
 // which one unit for all values lets them do.
 std::string plainDigits(float value);
 
+// What people must know of each table and list of percentiles. The bound is that of the sketch,
+// rounded up.
+static_assert(QuantileSketch::kError < 0.016);
+inline constexpr char kPercentileError[] = "each percentile may be up to 1.6 % too low or too high";
+
 // Writes the members `durations` in seconds and `frame_rates` in frames per second, each with the
 // count of values that it does not list.
 void addDurations(JsonWriter& json, const Durations& durations);

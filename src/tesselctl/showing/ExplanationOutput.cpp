@@ -155,14 +155,16 @@ std::string ExplanationLines::lines(const Explanation& explanation) const {
   const Date date{std::chrono::microseconds{static_cast<int64_t>(explanation.entry.realtime)}};
   const std::string time = withDay_ ? dateText(date).substr(5) : timeOfDayText(date);
   const size_t indent = timeWidth() + kVerdictWidth + 2 + kKindWidth + 2;
-  std::string out = padded(time, timeWidth());
+  // Only a time with its zone is longer than the column. It takes two spaces behind it, too.
+  const size_t beyond = std::max(time.size() + 2, timeWidth()) - timeWidth();
+  std::string out = padded(time, timeWidth() + beyond);
   out +=
       terminal_.paint(verdictColour(decision.classification),
                       padded(std::string(verdictName(decision.classification)), kVerdictWidth + 2));
   out += padded(shownKind(explanation.object), kKindWidth + 2);
   const std::string facts = shownFacts(explanation);
-  out +=
-      indented(shownPath(explanation.object) + (facts.empty() ? "" : " (" + facts + ")"), indent);
+  out += indented(shownPath(explanation.object) + (facts.empty() ? "" : " (" + facts + ")"), indent,
+                  beyond);
   if (const std::string why = ruleWords(decision, explanation.scope, terminal_); !why.empty()) {
     out += std::string(timeWidth(), ' ') + indented(why, timeWidth());
   }

@@ -48,8 +48,9 @@ class ExplanationLines {
   // The time, with the day if the period is longer than one day, and a gap of two columns. Within a
   // day the time alone says which entry is meant.
   size_t timeWidth() const { return withDay_ ? 16 : 10; }
-  std::string indented(const std::string& text, size_t indent) const {
-    return wrappedBeside(text, terminal_.width, indent) + "\n";
+  // A label longer than its column reaches `beyond` columns further, see wrappedBeside().
+  std::string indented(const std::string& text, size_t indent, size_t beyond = 0) const {
+    return wrappedBeside(text, terminal_.width, indent, beyond) + "\n";
   }
 
   const Terminal terminal_;

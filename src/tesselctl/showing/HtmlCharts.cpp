@@ -169,7 +169,8 @@ Html legend(const VerdictCounts& counts) {
 std::string sliceName(const Tally& tally, size_t slice) {
   const std::string date = dateText(tally.sliceStart(slice));
   const bool wholeDays = tally.sliceLength() >= std::chrono::hours{24};
-  return wholeDays ? date.substr(0, 10) : date.substr(5, 11);
+  // Behind the seconds a zone may stand, which tells the two rounds of a repeated hour apart.
+  return wholeDays ? date.substr(0, 10) : date.substr(5, 11) + date.substr(19);
 }
 
 Html timeChart(const Tally& tally) {

@@ -260,12 +260,15 @@ Html durationSection(const Tally& tally, Names& names) {
   Html html;
   if (!durations.text().empty()) {
     html << "<section>\n<h2>How long they took</h2>\n<p class=\"soft\">Trace points of all "
-            "verdicts. A "
-            "figure is within 1.6 %.</p>\n"
+            "verdicts; "
+         << kPercentileError << "; counts and longest durations are exact.</p>\n"
          << durations << "</section>\n";
   }
-  if (!frameRates.text().empty())
-    html << "<section>\n<h2>Frame rates</h2>\n" << frameRates << "</section>\n";
+  if (!frameRates.text().empty()) {
+    html << "<section>\n<h2>Frame rates</h2>\n<p class=\"soft\">Trace points of all verdicts; "
+         << kPercentileError << "; counts and lowest rates are exact.</p>\n"
+         << frameRates << "</section>\n";
+  }
   return html;
 }
 

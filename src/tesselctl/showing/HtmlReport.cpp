@@ -44,6 +44,12 @@ Html findingSection(const ReportFacts& facts) {
   for (const Finding& finding : *facts.findings)
     (isProblem(finding.code) ? problems : notes) << findingItem(finding, facts);
   html << "<section id=\"findings\">\n<h2>This machine, when the page was made</h2>\n";
+  // Without this line, "reported" on the page would be taken for what left the machine.
+  if (facts.reportingIsOff) {
+    html << "<p id=\"tasking\"><span class=\"bad\">Reporting is off.</span> ";
+    if (!facts.withoutValues) html << "<bdi>" << *facts.reportingIsOff << "</bdi>. ";
+    html << "&quot;Reported&quot; tells what a run would report if it were on.</p>\n";
+  }
   if (problems.text().empty())
     html << "<p><span class=\"good\">No problem was found.</span></p>\n";
   else

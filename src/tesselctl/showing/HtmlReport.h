@@ -25,6 +25,8 @@ struct ReportFacts {
   std::optional<RunRecord> run;  // absent unless the page shows the period of a run
   // What is wrong with this machine. Absent if the store may be that of another machine.
   std::optional<std::vector<Finding>> findings;
+  // Why this machine reports nothing, in words. Absent if it does report, or nobody knows.
+  std::optional<std::string> reportingIsOff;
   // The page is to be passed on to people outside: it names neither the machine nor its users,
   // programs and files, and shows no recorded value.
   bool withoutValues = false;
