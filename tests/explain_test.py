@@ -321,7 +321,7 @@ class Reading(ExplainTest):
         self.assertEqual(store["dropped"], [{"unit": "vantor.service", "count": 7}])
         self.assertEqual(self.summary()["without_exe"], 1)
         text = self.machine.ctl("explain", "--summary").out
-        for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed, not exported or lost", "(vantor.service)", "process gone before _EXE was read"):
+        for words in ("reaches back to", "7 numbers of entries that no file holds: vacuumed, not exported or lost", "(vantor.service)", "\nThe program of 1 trace point is not known: the process was gone before the journal looked"):
             self.assertIn(words, text)
         self.machine.write_export([log_event("young", at=-80), log_event("dated back", at=-9e5), log_event("young", at=-70)])
         os.unlink(os.path.join(self.machine.store, "b.export"))

@@ -37,11 +37,11 @@ class Rules(MachineTest):
             ("Selvin", False, ("com.vantor.Calendar", "View", "Open"), [], True, "no downsampling row"),
             ("Selvin", False, ("com.vantor.Calendar", "View", "Open"), [("s", "none"), ("t", "\x1bweek")], False, "string 2"),
             ("Selvin", True, ("com.vantor.Calendar", "View", "Open"), [("period", "weekly")], True, "internal"),
-            ("Quarro", False, ("com.vantor.Calendar", "View", "Open"), [("period", "week")], False, "known on Selvin"),
+            ("Quarro", False, ("com.vantor.Calendar", "View", "Open"), [("period", "week")], False, "it is a known value on Selvin"),
             ("Selvin", False, ("com.vantor.TextInput", "Keys", "Show"), [], True, "one in 503"),
             ("Selvin", True, ("com.vantor.quellan.knowledge", "tessel", "Footprint"), [], False, "none is reported"),
             ("Quarro", True, PERFORMANCE, [("c", "Application"), ("a", "Open")], True, "actions"),
-            ("Quarro", True, PERFORMANCE, [("c", "Application"), ("a", "open")], False, "known are Open"),
+            ("Quarro", True, PERFORMANCE, [("c", "Application"), ("a", "open")], False, "known values near it: 'Open', "),
             ("Quarro", True, PERFORMANCE, [], False, "string 1, which is absent"),
             ("Lumet", False, ("a", "b", "c"), [("s", "week")], False, "no list of Lumet"),
         ]
@@ -62,7 +62,7 @@ class Rules(MachineTest):
 
     def test_a_value_and_what_makes_no_sense(self):
         self.assertIn("period-views", self.rules("check", "week"))
-        self.assertIn("known are week", self.rules("check", "Weekly", status=1))
+        self.assertIn("a known value near it: 'week'", self.rules("check", "Weekly", status=1))
         self.assertIn("''", self.rules("check", "", status=1))
         self.assertIn("\\x1b[31m", self.rules("check", "\x1b[31m", status=1))
         self.machine.set_internal(True)

@@ -101,6 +101,13 @@ class Shown(SentTest):
         self.assertEqual((states("--sent", "--last", "1h"), states("--last", "1h")), (["sent"] * count, ["waiting"] * count))
         self.query(f"UPDATE forwarder_delivered SET delivered = delivered - {DAY}")
         self.assertEqual(states("--sent", "--last", "1h"), [])
+        for arguments, none in ((("--sent", "--last", "1h"), "No row was delivered, 20"), (("--sent", "--name", "x*"), "No row that fits was delivered\n"),
+                                (("--waiting", "--last", "1s", "--until", "-9d"), "No row waits, 20"), (("--name", "x*"), "No row that fits is here\n")):
+            totals = self.machine.ctl("events", *arguments).errors
+            self.assertRegex(totals, f"^{none}.*")
+            self.assertEqual(totals.splitlines()[1:], [f"In the whole spool: {count} rows wait, {count} rows delivered and still here"])
+        self.assertRegex(self.machine.ctl("events", "-n", str(count + 1)).errors,
+                         rf"^Shown: {count} rows wait, 1 row delivered\n1 row to {url}, the last at 20.*\nIn the whole spool: {count} rows wait, ")
         with self.database() as database:  # a record of the forwarder's own
             database.execute("INSERT INTO forwarder_delivered SELECT max(number) + 1, NULL, 1, max(delivered), max(running_bytes), "
                              "'https://b', 'tessel.health', '{}' FROM forwarder_delivered")

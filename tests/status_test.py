@@ -34,7 +34,7 @@ class LastRun(StatusTest):
         self.assertEqual(self.problems(), {"run_failed": None}, "no run came since")
         self.service()
         self.assertEqual(self.problems(), {}, "one came to its end, and had nothing to do")
-        self.assertRegex(self.call("tesselctl", "status").out, "All in all +off +this machine reports nothing; none of these")
+        self.assertRegex(self.call("tesselctl", "status").out, "All in all +off +this machine reports nothing; 'tesselctl tasking on' switches reporting on; none of these")
         self.machine.task()
         self.assertEqual(self.problems(), {"run_failed": None}, "the last one that was to report")
         self.service()

@@ -174,8 +174,7 @@ std::string comparisonText(const Comparison& comparison, const std::string& head
   }
   std::string out = heading + "\n" + sums.render(terminal, 2) + "\n" +
                     changesText(comparison, same, terminal) + periodsText(comparison, terminal);
-  if (!comparison.losses.empty()) out += "\n" + lossText(comparison.losses, terminal);
-  return out;
+  return out + lossText(comparison.losses, terminal);
 }
 
 int runCompare(const CompareOptions& options, const Surroundings& surroundings) {

@@ -76,6 +76,7 @@ class EventsRun {
   EventsRun(const EventsOptions& options, std::optional<Period> period,
             const Surroundings& surroundings)
       : options_(options),
+        period_(period),
         selection_(options, period),
         stateDirectory_(surroundings.launch.stateDirectory),
         spool_(surroundings.launch.stateDirectory),
@@ -117,9 +118,22 @@ class EventsRun {
     if (options_.json) return;
     const auto contents = spool_.contents();
     if (!contents) return;  // damaged since the last row was read; nothing is known
-    const std::string totals = eventTotals(*contents, spool_.deliveries());
+    const std::string totals = options_.choose() ? whyNone() + chosenTotals(printed_, *contents)
+                                                 : eventTotals(*contents, spool_.deliveries());
     terminal_.interactive ? print(terminal_.paint(Colour::faint, totals)) : printError(totals);
     flushOutput();
+  }
+
+  // Whoever asks for yesterday must not take the sums of the whole spool for an answer.
+  std::string whyNone() const {
+    if (!printed_.none()) return "";
+    const bool patterns =
+        !options_.names.empty() || !options_.subsystems.empty() || !options_.categories.empty();
+    return std::string(patterns ? "No row that fits" : "No row") +
+           (options_.sent      ? " was delivered"
+            : options_.waiting ? " waits"
+                               : " is here") +
+           (period_ ? ", " + periodText(*period_) : "") + "\n";
   }
 
   // That no row is there is an answer, and no failure. Where the state directory is something else,
@@ -195,18 +209,24 @@ class EventsRun {
 
   // A row on a terminal shows neither year nor zone, so a line above the first does.
   void printRow(const SpoolRow& row) {
+    printed_.add(row);
     if (options_.json) return print(eventJson(row));
-    if (terminal_.interactive && !std::exchange(headed_, true)) print(eventHeading(row, terminal_));
-    print(eventLine(row, terminal_));
+    // As the period that --sent takes, so the times that it shows.
+    const RowTime time = options_.sent ? RowTime::ofDelivery : RowTime::ofEvent;
+    if (terminal_.interactive && !std::exchange(headed_, true))
+      print(eventHeading(row, time, terminal_));
+    print(eventLine(row, time, terminal_));
   }
 
   const EventsOptions& options_;
+  const std::optional<Period> period_;
   const RowSelection selection_;
   const std::string stateDirectory_;
   SpoolReader spool_;
   const Terminal& terminal_;
   bool followed_ = false;
   bool headed_ = false;
+  ChosenRows printed_;
 };
 
 int showEvent(const EventsOptions& options, const Surroundings& surroundings) {
@@ -259,7 +279,7 @@ CommandText eventsText() {
           "  tesselctl events -n 20\n"
           "  tesselctl events --sent --since yesterday --until today\n"
           "  tesselctl events show 42\n"
-          "  tesselctl events | grep -c period=week\n"
+          "  tesselctl events | grep -c String1Value=week\n"
           "  tesselctl events --name '*.tessel_reporting_stats' --json\n"
           "  tesselctl events --follow --subsystem com.vantor.Calendar"};
 }

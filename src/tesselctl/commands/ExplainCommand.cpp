@@ -139,6 +139,7 @@ class ExplainRun {
         if (loss.code != LossCode::fileDamaged || reading_.store != kStandardInput) lost.add(loss);
       }
       for (const std::string& loss : lossLines(lost, 1)) say("Lost: " + terminalText(loss));
+      if (const std::string unknown = unknownPrograms(lost); !unknown.empty()) say(unknown);
     }
     // A store that the command line names may be a copy from elsewhere.
     const Tasking tasking = askTasking(launch_);

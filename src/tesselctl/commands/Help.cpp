@@ -27,6 +27,11 @@ class NarrowFormatter final : public CLI::Formatter {
   std::string make_option_desc(const CLI::Option* option) const override {
     return wrapped(option->get_description(), kWidth - kColumn, 0);
   }
+  // The parser would print "WORDS(1x)" for an argument of one to three words.
+  std::string make_option_usage(const CLI::Option* option) const override {
+    if (option->get_expected_max() <= 1) return CLI::Formatter::make_option_usage(option);
+    return make_option_name(option, true) + "...";
+  }
   std::string make_subcommand(const CLI::App* command) const override {
     std::ostringstream out;
     CLI::detail::format_help(out, command->get_name(),
@@ -36,7 +41,7 @@ class NarrowFormatter final : public CLI::Formatter {
 };
 
 constexpr std::array<std::pair<std::string_view, std::string_view>, 13> kVariables = {{
-    {"TESSEL_TRACE_STORE", "trace store, where --store names none [the machine's journal]"},
+    {"TESSEL_TRACE_STORE", "trace store, unless an option names one [the machine's journal]"},
     {"TESSEL_STATE_DIR",
      "the service's state directory, with the spool and the record of its runs "
      "[$STATE_DIRECTORY, else /var/lib/tessel]"},

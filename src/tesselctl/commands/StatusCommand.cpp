@@ -227,7 +227,7 @@ int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
   // The screen is printed first: facts that he may see are worth showing.
   const Finding& first = status.findings.front();
   if (first.code != FindingCode::noAccess) return kBad;
-  return failToRead({ErrorCode::noAccess, first.words}, status.stateDirectory);
+  return fail(kNoAccess, first.words + "; " + first.command + " shows all");
 }
 
 // Problems first, as in the list of codes.

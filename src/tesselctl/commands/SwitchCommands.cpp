@@ -18,6 +18,7 @@
 #include "tasking/TaskingGate.h"
 #include "tesselctl/commands/Command.h"
 #include "tesselctl/judging/Tasking.h"
+#include "tesselctl/reading/TimeArguments.h"
 
 namespace tessel::ctl {
 
@@ -59,16 +60,22 @@ std::string deferFile(const Surroundings& surroundings) {
   return StateDirectory::forReading(surroundings.launch.stateDirectory).deferFile();
 }
 
-int showDeferral(const SwitchOptions& options, bool wanted, bool changed, const std::string& file) {
+// A run that waits looks for the file only when its next offer is due. Whoever ends the deferral
+// must know how long nothing may happen.
+int showDeferral(const SwitchOptions& options, const Surroundings& surroundings, bool wanted,
+                 bool changed, const std::string& file) {
   if (options.json) {
     print(objectLine([&](JsonWriter& json) {
       json.member("defer", wanted).member("changed", changed).member("file", file);
     }));
   } else if (wanted) {
-    print(changed ? "Runs are put off from now on; a run under way ends within 10 seconds.\n"
-                  : "Runs were put off already.\n");
+    print(changed
+              ? "Runs are put off from now on; a run under way stops reading within 20 seconds.\n"
+              : "Runs were put off already.\n");
   } else {
-    print(changed ? "Runs are no longer put off.\n" : "Runs were not put off.\n");
+    print(changed ? "Runs are no longer put off; one that waits begins within " +
+                        durationText(surroundings.launch.deferRetry) + ".\n"
+                  : "Runs were not put off.\n");
   }
   return kDone;
 }
@@ -88,7 +95,7 @@ int deferOn(const SwitchOptions& options, const Surroundings& surroundings) {
         "TESSEL_DEFER_ON does not name \"file\": a service started like this does not look for "
         "it.\n");
   }
-  return showDeferral(options, true, made, file);
+  return showDeferral(options, surroundings, true, made, file);
 }
 
 int deferOff(const SwitchOptions& options, const Surroundings& surroundings) {
@@ -98,7 +105,7 @@ int deferOff(const SwitchOptions& options, const Surroundings& surroundings) {
   const bool removed = ::unlink(file.c_str()) == 0;
   const int error = errno;
   if (!removed && error != ENOENT) return failToWrite(fileError(file, error));
-  return showDeferral(options, false, removed, file);
+  return showDeferral(options, surroundings, false, removed, file);
 }
 
 // The configuration with the new answer. Keys of other owners stay as they are. So a file that

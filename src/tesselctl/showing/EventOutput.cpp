@@ -109,11 +109,15 @@ std::string rowFields(const SpoolRow& row, const Terminal& terminal) {
 constexpr size_t kIdWidth = 6;
 constexpr size_t kEventWidth = 22;
 
-std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
+Date timeOf(const SpoolRow& row, RowTime time) {
+  return dateOf(time == RowTime::ofDelivery ? row.delivery->at : row.event.time);
+}
+
+std::string humanLine(const SpoolRow& row, RowTime which, const Terminal& terminal) {
   const SpooledEvent& event = row.event;
   std::string name = shortened(shownName(event.name), kEventWidth);
   name.append(kEventWidth - std::min(kEventWidth, displayWidth(name)), ' ');
-  const std::string time = dateText(dateOf(event.time)).substr(5);
+  const std::string time = dateText(timeOf(row, which)).substr(5);
   std::string id = idText(event);
   id.insert(0, kIdWidth - std::min(kIdWidth, id.size()), ' ');
   const std::string state = row.delivery ? "delivered" : "waits    ";
@@ -127,8 +131,11 @@ std::string humanLine(const SpoolRow& row, const Terminal& terminal) {
 
 }  // namespace
 
-std::string eventHeading(const SpoolRow& first, const Terminal& terminal) {
-  return terminal.paint(Colour::faint, "First row: " + zonedText(dateOf(first.event.time))) + "\n";
+std::string eventHeading(const SpoolRow& first, RowTime time, const Terminal& terminal) {
+  return terminal.paint(Colour::faint,
+                        (time == RowTime::ofDelivery ? "First delivery: " : "First row: ") +
+                            zonedText(timeOf(first, time))) +
+         "\n";
 }
 
 EventPath pathOf(const SpooledEvent& row) {
@@ -174,26 +181,67 @@ std::string wholeEvent(const SpoolRow& row, const Terminal& terminal) {
   return out + laidOut(escaped) + "\n";
 }
 
-std::string eventLine(const SpoolRow& row, const Terminal& terminal) {
-  return terminal.interactive ? humanLine(row, terminal) : rowFields(row, terminal);
+std::string eventLine(const SpoolRow& row, RowTime time, const Terminal& terminal) {
+  return terminal.interactive ? humanLine(row, time, terminal) : rowFields(row, terminal);
 }
 
-std::string eventTotals(const SpoolContents& contents, const std::vector<Delivered>& deliveries) {
-  const auto rows = [](int64_t count) {
-    return counted(static_cast<uint64_t>(count), "row", "rows");
-  };
-  std::string out = rows(contents.rows) + (contents.rows == 1 ? " waits" : " wait") + ", " +
-                    rows(contents.delivered) + " delivered and still here\n";
-  for (const Delivered& one : deliveries) {
-    out += rows(one.rows) + " to " + terminalText(one.destination) + ", the last at " +
+namespace {
+
+std::string rowsText(int64_t count) { return counted(static_cast<uint64_t>(count), "row", "rows"); }
+
+std::string stateCounts(int64_t waiting, int64_t delivered) {
+  return rowsText(waiting) + (waiting == 1 ? " waits" : " wait") + ", " + rowsText(delivered) +
+         " delivered";
+}
+
+std::string destinationLines(const std::vector<Delivered>& destinations) {
+  std::string out;
+  for (const Delivered& one : destinations) {
+    out += rowsText(one.rows) + " to " + terminalText(one.destination) + ", the last at " +
            zonedText(dateOf(one.last)) + "\n";
   }
-  if (contents.setAside != 0) {
-    out += rows(contents.setAside) +
-           " refused by the collector and set aside; 'statora_forwarder --requeue' lets them wait"
-           " again\n";
-  }
   return out;
+}
+
+std::string refusedLine(const SpoolContents& contents) {
+  if (contents.setAside == 0) return "";
+  return rowsText(contents.setAside) +
+         " refused by the collector and set aside; 'statora_forwarder --requeue' lets them wait"
+         " again\n";
+}
+
+}  // namespace
+
+std::string eventTotals(const SpoolContents& contents, const std::vector<Delivered>& deliveries) {
+  return stateCounts(contents.rows, contents.delivered) + " and still here\n" +
+         destinationLines(deliveries) + refusedLine(contents);
+}
+
+// A spool may hold rows for any number of destinations that somebody has written. People read a few
+// lines.
+void ChosenRows::add(const SpoolRow& row) {
+  constexpr size_t kMostDestinations = 8;
+  if (!row.delivery) {
+    ++waiting;
+    return;
+  }
+  ++delivered;
+  const auto& [at, destination] = *row.delivery;
+  auto known = std::ranges::find(destinations, destination, &Delivered::destination);
+  if (known == destinations.end()) {
+    if (destinations.size() == kMostDestinations) return;
+    known = destinations.insert(known, Delivered{destination});
+  }
+  ++known->rows;
+  known->last = std::max(known->last, at);
+}
+
+std::string chosenTotals(const ChosenRows& chosen, const SpoolContents& contents) {
+  const std::string shown =
+      chosen.none() ? "" : "Shown: " + stateCounts(chosen.waiting, chosen.delivered) + "\n";
+  return shown + destinationLines(chosen.destinations) +
+         "In the whole spool: " + stateCounts(contents.rows, contents.delivered) +
+         " and still here\n" + refusedLine(contents);
 }
 
 }  // namespace tessel::ctl

@@ -8,6 +8,8 @@
 
 #include "tesselctl/showing/HtmlReport.h"
 
+#include <algorithm>
+
 #include "tesselctl/showing/HtmlCharts.h"
 #include "tesselctl/showing/HtmlLists.h"
 #include "tesselctl/showing/Losses.h"
@@ -154,12 +156,17 @@ class LossSection {
     Html html;
     const std::string part = partOfPeriod(reading_);
     const std::string unread = unreadPart(reading_);
-    if (part.empty() && unread.empty() && reading_.losses.empty()) return html;
-    html << "<section>\n<h2>" << title_ << "</h2>\n";
-    for (const std::string& sentence : {part, unread})
+    const std::string programs = unknownPrograms(reading_.losses);
+    const bool lost = std::ranges::any_of(reading_.losses.all(),
+                                          [](const Loss& loss) { return isLost(loss.code); });
+    const bool partial = lost || !part.empty() || !unread.empty();
+    if (!partial && programs.empty()) return html;
+    html << "<section>\n<h2>" << (partial ? title_ : std::string_view("What is not known"))
+         << "</h2>\n";
+    for (const std::string& sentence : {part, unread, programs})
       if (!sentence.empty()) html << "<p>" << sentence << ".</p>\n";
     return html << table("losses", "Losses by reason", "Where",
-                         [](LossCode code) { return !isOfWriter(code); })
+                         [](LossCode code) { return isLost(code) && !isOfWriter(code); })
                 << table("lost_at_source",
                          "Trace points that programs could not hand to the journal",
                          "User and program",

@@ -137,11 +137,22 @@ std::string unreadPart(const StoreReading& reading) {
          " of its day were not read";
 }
 
+std::string unknownPrograms(const Losses& losses) {
+  const uint64_t count = losses.sum(LossCode::noImagePath);
+  if (count == 0) return {};
+  return "The program of " + counted(count, "trace point is", "trace points is") +
+         " not known: the process was gone before the journal looked";
+}
+
 std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode) {
   std::vector<std::string> lines;
   const std::vector<Loss>& all = losses.all();
   for (size_t at = 0; at < all.size();) {
     const LossCode code = all[at].code;
+    if (!isLost(code)) {
+      ++at;
+      continue;
+    }
     // The rest is the sum less the shown losses, so the lines always add up to the sum.
     uint64_t further = losses.sum(code);
     for (size_t shown = 0; at < all.size() && all[at].code == code; ++at, ++shown) {
@@ -157,10 +168,13 @@ std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode) {
 // Lines and not a table: the end of a path, the byte in the file and a unit's name all matter, and
 // the columns of a table would cut them.
 std::string lossText(const Losses& losses, const Terminal& terminal) {
-  if (losses.empty()) return {};
-  std::string out = terminal.paint(Colour::strong, "What was lost") + "\n";
-  for (const std::string& line : lossLines(losses, Losses::kMaxOfACode))
+  std::string out;
+  const auto lines = lossLines(losses, Losses::kMaxOfACode);
+  if (!lines.empty()) out += "\n" + terminal.paint(Colour::strong, "What was lost") + "\n";
+  for (const std::string& line : lines)
     out += "  " + wrapped(terminalText(line), terminal.width - 2, 4) + "\n";
+  if (const std::string unknown = unknownPrograms(losses); !unknown.empty())
+    out += "\n" + wrapped(unknown, terminal.width, 2) + ".\n";
   return out;
 }
 

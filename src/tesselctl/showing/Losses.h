@@ -35,10 +35,18 @@ void addStore(JsonWriter& json, const StoreReading& reading);
 // The members of a reading as `status --json` has it.
 void addReading(JsonWriter& json, const StoreReading& reading);
 
-// One line for each loss. A code gets at most `mostOfACode` lines, and one more for all its other
-// losses. The caller must still make the lines fit for a terminal.
+// A sentence on trace points whose program is not known, without its full stop; else empty. They
+// were read and judged, so nothing of them is lost.
+std::string unknownPrograms(const Losses& losses);
+// Whether something is missing because of it.
+inline bool isLost(LossCode code) { return code != LossCode::noImagePath; }
+
+// One line for each loss, but for what unknownPrograms() tells. A code gets at most `mostOfACode`
+// lines, and one more for all its other losses. The caller must still make the lines fit for a
+// terminal.
 std::vector<std::string> lossLines(const Losses& losses, size_t mostOfACode);
-// All losses under a heading, fit for `terminal`; empty where there is none.
+// All losses under a heading, and unknownPrograms(), each with an empty line before it; fit for
+// `terminal`. Empty where there is none.
 std::string lossText(const Losses& losses, const Terminal& terminal);
 
 }  // namespace tessel::ctl

@@ -108,8 +108,12 @@ std::string stringWords(const StringAnswer& string, const CheckAnswer& answer) {
   } else {
     words += " stands on no list of " + std::string(nameForPlatform(answer.machine.platform));
   }
-  if (!string.near.empty()) words += "; known are " + joined(string.near, ", ");
-  if (!string.elsewhere.empty()) words += "; known on " + joined(string.elsewhere, ", ");
+  if (!string.near.empty())
+    words +=
+        (string.near.size() == 1 ? "; a known value near it: '" : "; known values near it: '") +
+        joined(string.near, "', '") + "'";
+  if (!string.elsewhere.empty())
+    words += "; it is a known value on " + joined(string.elsewhere, ", ");
   return words;
 }
 

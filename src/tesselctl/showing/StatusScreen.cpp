@@ -32,7 +32,10 @@ class Screen {
     lastRun();
     for (const Marker& each : status_.markers) marker(each);
     spool();
-    if (status_.spool.forwarder) forwarder(*status_.spool.forwarder);
+    if (status_.spool.forwarder)
+      forwarder(*status_.spool.forwarder);
+    else if (status_.spoolState == SpoolReader::State::open)
+      line("Forwarder", "none", Colour::plain, "none has worked on this spool: its rows stay here");
     journal();
     findings();
     return out_;
@@ -75,6 +78,11 @@ class Screen {
   }
 
   void lastRun() {
+    const auto& failure = status_.recordFailure;
+    if (failure && failure->code == ErrorCode::noAccess) {
+      line("Last run", "no access", Colour::caution, failure->words);
+      return;
+    }
     if (!status_.run) {
       line("Last run", "none", Colour::plain, "no record of a run in the state directory");
     } else {
@@ -177,7 +185,8 @@ class Screen {
     if (reading.filesOutsideRange != 0)
       words += ", " + counted(reading.filesOutsideRange, "file", "files") + " of other days";
     const std::string part = partOfPeriod(reading);
-    const bool whole = reading.losses.empty() && !reading.stopped;
+    const auto losses = lossLines(reading.losses, kLossesOfACode);
+    const bool whole = losses.empty() && !reading.stopped;
     const bool late = whole && !part.empty();
     line("Store",
          late    ? "begins late"
@@ -186,7 +195,9 @@ class Screen {
          whole ? Colour::good : Colour::caution, words);
     if (!part.empty()) more(part);
     if (reading.stopped) more(unreadPart(reading));
-    for (const std::string& loss : lossLines(reading.losses, kLossesOfACode)) more(loss);
+    for (const std::string& loss : losses) more(loss);
+    if (const std::string unknown = unknownPrograms(reading.losses); !unknown.empty())
+      more(unknown);
   }
 
   // The file alone does not tell a run at work from one that died. We say both and give the age of
@@ -237,24 +248,36 @@ class Screen {
       words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
                dateText(Date{std::chrono::microseconds{*spool.newest}});
     }
-    line("Spool", counted(static_cast<uint64_t>(spool.rows), "row", "rows"), Colour::plain, words);
+    if (spool.delivered != 0)
+      words += "; " +
+               counted(static_cast<uint64_t>(spool.delivered), "delivered row", "delivered rows") +
+               " kept";
+    const auto rows = static_cast<uint64_t>(spool.rows);
+    line("Spool", counted(rows, "row waits", "rows wait"), Colour::plain, words);
   }
 
   void forwarder(const ForwarderCounters& counters) {
-    // Retries are no trouble: collectors are away now and then, and nothing is lost by waiting.
+    // A collector that is away now and then is no trouble: nothing is lost by waiting. But who asks
+    // why rows wait must see its last answer at once.
     const bool trouble = counters.rejected + counters.setAside > 0;
+    const bool inVain = counters.lastErrorAt > counters.lastSuccess;
+    const auto at = [](uint64_t time) {
+      return Date{std::chrono::microseconds{static_cast<int64_t>(time)}};
+    };
     std::string words = grouped(counters.delivered) + " delivered in " +
                         counted(counters.requests, "request", "requests") + ", " +
                         grouped(counters.refusedRequests) + " of them refused and " +
                         grouped(counters.failedRequests) + " failed on the way, " +
                         grouped(counters.rejected) + " rejected, " + grouped(counters.setAside) +
                         " set aside";
-    if (counters.lastSuccess != 0) {
-      const auto last = static_cast<int64_t>(counters.lastSuccess);
-      words += "; last " + since(Date{std::chrono::microseconds{last}});
-    }
-    line("Forwarder", trouble ? "refused some" : "in use",
-         trouble ? Colour::caution : Colour::plain, words);
+    if (counters.lastSuccess != 0) words += "; last " + since(at(counters.lastSuccess));
+    if (inVain)
+      words += "; the last try, " + since(at(counters.lastErrorAt)) + ": " + counters.lastError;
+    line("Forwarder",
+         inVain    ? "in vain"
+         : trouble ? "refused some"
+                   : "in use",
+         trouble || inVain ? Colour::caution : Colour::plain, words);
   }
 
   // A finding in full: what it is, since when, what to do, and a command. What follows from it
@@ -299,7 +322,11 @@ class Screen {
     if (problems != 0) {
       line("All in all", "NOT GOOD", Colour::bad, sum);
     } else if (!status_.tasking.decision.on()) {
-      line("All in all", "off", Colour::caution, "this machine reports nothing; " + sum);
+      // Who set up a share of a fleet has switched this machine off on purpose.
+      line("All in all", "off", Colour::caution,
+           std::string("this machine reports nothing; ") +
+               (status_.tasking.rollout ? "" : "'tesselctl tasking on' switches reporting on; ") +
+               sum);
     } else if (std::any_of(status_.findings.begin(), status_.findings.end(), isIdle)) {
       line("All in all", "idle", Colour::caution,
            "reporting is on, but nothing starts a run; " + sum);

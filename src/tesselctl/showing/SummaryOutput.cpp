@@ -320,7 +320,7 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
   const StoreReading& reading = report.store.reading;
   for (const std::string& note : notesOn(reading))
     out += "\n" + wrapped(terminalText(note), terminal.width, 2) + ".\n";
-  if (!reading.losses.empty()) out += "\n" + lossText(reading.losses, terminal);
+  out += lossText(reading.losses, terminal);
   return out;
 }
 
