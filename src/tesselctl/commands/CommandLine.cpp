@@ -54,6 +54,8 @@ std::vector<std::string> namesOfCommands(const CLI::App& command) {
 std::string argumentsOf(const CLI::App& command) {
   std::vector<std::string> words;
   for (const CLI::Option* option : optionsOf(command)) {
+    // As the usage line writes them, so that a reader finds the words of the message again in
+    // --help.
     if (option->nonpositional()) continue;
     std::string word = option->get_name();
     std::ranges::transform(word, word.begin(), [](unsigned char c) { return std::toupper(c); });
@@ -62,11 +64,15 @@ std::string argumentsOf(const CLI::App& command) {
   return joined(words, " ");
 }
 
+// All options are named and not only near ones: a command has a dozen at most, and whoever mistook
+// one most often looks for another.
 std::string unknownOption(const CLI::App& command, const std::string& word) {
   std::vector<std::string> names;
   for (const CLI::Option* option : optionsOf(command)) {
     for (const std::string& name : option->get_lnames()) names.push_back("--" + name);
   }
+  // What stands behind an equals sign is a value, and may be a secret that was put behind the wrong
+  // name.
   return nameOf(command) + " has no option '" + word.substr(0, word.find('=')) + "'; it has " +
          joined(names, ", ");
 }
@@ -109,6 +115,8 @@ std::string missing(const CLI::App& command, const CLI::Option& option) {
 
 std::string mismatch(const CLI::Option& option, const std::string& message) {
   const std::string name = option.get_name();
+  // The parser has one kind of error for several mistakes, and only its words tell them apart. A
+  // test holds each of our messages against a command line that makes it.
   if (message.find("override") != std::string::npos) return name + " takes no value";
   if (message.find("At Most") == std::string::npos) {
     const std::vector<std::string> values = valuesOf(option);
@@ -139,6 +147,8 @@ std::string messageFor(const CLI::App& command, const CLI::ParseError& error,
     return nameOf(command) + " needs one of " + joined(namesOfCommands(command), ", ");
   if (kind == CLI::ExitCodes::ExcludesError || kind == CLI::ExitCodes::RequiresError) {
     const size_t verb = words.find(' ');
+    // The parser's sentence names both options, first and last. What it says between them we say in
+    // our words.
     return words.substr(0, verb) +
            (kind == CLI::ExitCodes::ExcludesError ? " cannot stand with" : " needs") +
            words.substr(words.rfind(' '));
@@ -187,6 +197,8 @@ CLI::Option* takesOneOf(CLI::Option* option, const std::vector<std::string>& wor
 CLI::Option* takesWhole(CLI::Option* option, uint64_t least, uint64_t most,
                         const std::string& unit) {
   const auto check = [=](const std::string& value) {
+    // from_chars() takes no blank, no sign, no other base and nothing behind the digits, so a
+    // mistyped number is never another one.
     uint64_t number = 0;
     const char* end = value.data() + value.size();
     const auto [stop, error] = std::from_chars(value.data(), end, number);
@@ -214,6 +226,7 @@ CLI::Option* suggestsFiles(CLI::Option* option) {
 
 void refuseValuesOfFlags(CLI::App& command) {
   for (CLI::Option* option : command.get_options([](CLI::Option*) { return true; })) {
+    // A script that writes --json=$wanted would get JSON where it wanted none, too.
     if (option->get_items_expected_max() == 0) option->disable_flag_override();
   }
   for (CLI::App* inner : command.get_subcommands([](CLI::App*) { return true; }))

@@ -28,9 +28,13 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
   std::set<std::string> given;  // what was set, so that a second word for it is a mistake
   for (size_t begin = 0; begin <= words.size();) {
     const size_t end = std::min(words.find(',', begin), words.size());
+    // A comma ends a word, and an empty word is a mistake: it is what a variable that is not set
+    // leaves behind.
     const std::string word = words.substr(begin, end - begin);
     begin = end + 1;
     if (word == "usual") continue;
+    // Two words for the same thing are refused and not overridden: with "internal,no-internal"
+    // nobody could tell which one the figures are of.
     const auto platform = platformNamed(word);
     const std::string what = platform                     ? "platform"
                              : word.ends_with("internal") ? "internal"
@@ -66,6 +70,8 @@ std::optional<Setting> settingOf(const std::string& words, const Reading& usual,
   return setting;
 }
 
+// The slot and the value stand only beside the whitelist. For any other rule a slot of 0 would look
+// like a string that failed.
 void writeChange(JsonWriter& json, const Change& change, uint64_t count) {
   json.object([&] {
     json.member("change", change.starts ? "start" : "stop");
@@ -76,6 +82,7 @@ void writeChange(JsonWriter& json, const Change& change, uint64_t count) {
 }
 
 void writePeriods(JsonWriter& json, const Comparison& comparison) {
+  // Over one period both sides hold the same objects, so durations would be the same twice.
   const auto& a = comparison.periods[0];
   const auto& b = comparison.periods[1];
   if (!a || !b) return;
@@ -90,6 +97,8 @@ void writePeriods(JsonWriter& json, const Comparison& comparison) {
   });
 }
 
+// The counts of all changes stand beside the list of them, which has a bound. A script can tell
+// from the difference that the list is not whole.
 std::string comparisonJson(const Comparison& comparison) {
   return objectLine([&](JsonWriter& json) {
     json.object("a", [&] { addVerdicts(json, comparison.sides[0]); });
@@ -167,6 +176,8 @@ std::string changesText(const Comparison& comparison, bool same, const Terminal&
 
 std::string comparisonText(const Comparison& comparison, const std::string& heading, bool same,
                            const Terminal& terminal) {
+  // Also the verdicts without an object are listed. The two columns then have a row each for every
+  // verdict, and each column adds up to all objects of its side.
   Table sums({{"VERDICT"}, {"A", Table::Align::right}, {"B", Table::Align::right}});
   for (const auto verdict : kVerdictOrder) {
     sums.add({std::string(verdictName(verdict)), terminal.number(comparison.sides[0][verdict]),
@@ -182,9 +193,13 @@ int runCompare(const CompareOptions& options, const Surroundings& surroundings) 
   const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
   const auto a = settingOf(options.settings[0], *reading, surroundings.now);
+  // The second setting is not looked at if the first makes no sense: one mistake, one line on
+  // stderr.
   const auto b = a ? settingOf(options.settings[1], *reading, surroundings.now) : std::nullopt;
   if (!b) return kUsage;
   const Setting settings[2] = {*a, *b};
+  // We could keep the stream in memory or on the disk, but it may have gigabytes. A file that the
+  // user made is one that he knows of and removes.
   if (!samePeriod(settings) && reading->store == kStandardInput) {
     return fail(kUsage,
                 "--store: '-' can be read once, and each of two periods needs a reading: keep the "

@@ -41,9 +41,12 @@ class PlaceOfWord {
 
   std::vector<std::string> offers(const std::string& begun) {
     if (awaited_ != nullptr) return valuesOf(*awaited_);
+    // We know nothing of another program but that its arguments are often files.
     if (otherProgram_) return {std::string(kFiles)};
     if (!begun.empty() && begun.front() == '-') return options();
     std::vector<std::string> words;
+    // Behind an argument a command is none any more: `rules check` takes words, and `check` may be
+    // one of them.
     if (arguments_ == 0) {
       for (const CLI::App* command : command_->get_subcommands({}))
         words.push_back(command->get_name());
@@ -95,6 +98,7 @@ int complete(CLI::App& app, const std::vector<std::string>& words) {
   const std::string begun = words.empty() ? "" : words.back();
   for (size_t i = 0; i + 1 < words.size(); ++i) position.pass(words[i]);
   for (const std::string& word : position.offers(begun)) {
+    // A word a line, since no word that we offer holds a line feed, and the shell splits at them.
     if (word == kFiles || word.starts_with(begun)) print(word + "\n");
   }
   return kDone;

@@ -100,6 +100,7 @@ class EventsRun {
     return options_.follow ? follow() : kDone;
   }
 
+  // A row may have been delivered since somebody saw its id, so both tables are searched.
   int showRow(int64_t id) {
     const SpoolReader::State state = spool_.open();
     if (state != SpoolReader::State::open) return complain(state);
@@ -115,6 +116,8 @@ class EventsRun {
  private:
   // In a pipe each line is a row, so the totals go to standard error.
   void showTotals() {
+    // A program that asks for JSON adds up the rows by itself, and would have to take these lines
+    // out of what it logs.
     if (options_.json) return;
     const auto contents = spool_.contents();
     if (!contents) return;  // damaged since the last row was read; nothing is known

@@ -34,6 +34,8 @@ struct ExplainOptions {
 };
 
 // Builds the payload with the code and the facts of a run, identities of processes included.
+// A payload needs the mount table and the metadata of bundles, which cost file accesses. It is made
+// only where --payload asks for it.
 class PayloadBuilder {
  public:
   PayloadBuilder() : identity_(bundles_), bootVolume_(bootVolumeFacts(volumes_)) {}
@@ -76,6 +78,8 @@ class ExplainRun {
  private:
   void inspect(const TesselObject& object, const EntryHeader& entry) {
     const FilterDecision decision = judge_.inspect(object);
+    // Judged before it is chosen: an object that is not shown has moved the counters of
+    // downsampling all the same, as in a run.
     if (!selection_.chooses(object, decision.classification)) return;
     tally_.count(object, decision, entry);
     if (options_.summary) return;
@@ -92,10 +96,13 @@ class ExplainRun {
   std::string text(const Explanation& explanation) const {
     if (options_.json) return explanationJson(explanation);
     if (!terminal_.interactive) return explanationFields(explanation, options_.payload, terminal_);
+    // The heading waits for the first row. Above nothing it would look like an answer.
     const bool first = tally_.traceObjects() == 1;
     return (first ? lines_.heading() : "") + lines_.lines(explanation);
   }
 
+  // A reader of the pipe waits for each line, so the buffer is written whenever nothing more is to
+  // be read for now.
   int follow() {
     const auto error = run_.follow(now_, flushWhileWaiting, [](const std::string& reason) {
       printError("Waiting for a journal: " + terminalText(reason) + "\n");
@@ -150,6 +157,8 @@ class ExplainRun {
     }
   }
 
+  // An empty answer has four usual reasons: the wrong store, the wrong period, nothing recorded,
+  // and a mistyped pattern. The lines let the reader tell them apart.
   std::vector<std::string> whyNothing() const {
     const ExtractionReport report = run_.report();
     const std::string store = reading_.store.value_or("the journal of this machine");
@@ -168,6 +177,7 @@ class ExplainRun {
 
   // The begins among them that the patterns choose, with the first few of their names.
   std::string openBegins() {
+    // Five names fit two lines. More would hide the losses that are told next.
     constexpr size_t kNamed = 5;
     std::vector<std::string> names;
     uint64_t begins = 0;
@@ -185,6 +195,8 @@ class ExplainRun {
     return words + (begins > names.size() ? ", ..." : "");
   }
 
+  // Verdicts that no object got are left out here: the line is for a glance, and --summary has them
+  // all.
   std::string closingLine() const {
     std::string counts;
     for (const auto verdict : kVerdictOrder) {
@@ -218,6 +230,7 @@ int runExplain(const ExplainOptions& options, const Surroundings& surroundings) 
   checkZone();
   const auto reading = readingOf(options.reading, surroundings);
   if (!reading) return kUsage;
+  // A summary has an end, and what is followed has none. A period would have to be waited for.
   if (options.follow && (options.summary || options.reading.period.given())) {
     return fail(
         kUsage,
@@ -277,6 +290,8 @@ CommandText explainText() {
           "  tesselctl explain --last 7d | cut -f 2 | sort | uniq -c"};
 }
 
+// From the same table as the output, so that the help and the completion offer each word that can
+// occur, and no other.
 std::vector<std::string> verdictWords() {
   std::vector<std::string> words;
   for (const auto verdict : kVerdictOrder) words.emplace_back(verdictName(verdict));

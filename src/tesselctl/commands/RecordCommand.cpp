@@ -83,6 +83,8 @@ std::optional<uint64_t> movedMonotonic(const RecordOrigin& now, uint64_t realtim
   return now.monotonic + static_cast<uint64_t>(distance);
 }
 
+// Checked before the file is opened: a store must not grow by an entry whose times contradict each
+// other.
 std::variant<RecordOrigin, Failure> originOf(const OriginOptions& options) {
   const RecordOrigin now = currentOrigin();
   RecordOrigin origin = now;
@@ -126,9 +128,12 @@ std::optional<Failure> record(const RecordOptions& options, const RecordedPoint&
   if (options.store) {
     auto origin = originOf(options.origin);
     if (auto* failure = std::get_if<Failure>(&origin)) return *failure;
+    // The facts that a daemon would have noted go into the same entry, so a reader sees no
+    // difference.
     error = appendToExportFile(*options.store, std::get<RecordOrigin>(origin), list);
   } else {
     error = sendToJournal(list);
+    // A container has no journal socket more often than a machine has a broken one.
     if (error && error->code == ErrorCode::notFound) {
       error->words += " (--store DIR records without a journal)";
     }
@@ -158,6 +163,8 @@ int runCommand(const std::vector<std::string>& command) {
   sigaddset(&defaults, SIGQUIT);
   sigaddset(&defaults, SIGXFSZ);
   posix_spawnattr_t attributes;
+  // posix_spawn() and not fork(): it tells whether the command could be run at all, which a child
+  // of fork() could only tell by an exit status that the command may have, too.
   posix_spawnattr_init(&attributes);
   posix_spawnattr_setsigdefault(&attributes, &defaults);
   posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGDEF);
@@ -245,6 +252,8 @@ std::string whyNotAgo(const std::string& text) {
 }
 
 std::string whyNoProcess(const std::string& text) {
+  // Ten digits hold each 32-bit number. The journal keeps the text as it is, so more would be read
+  // as no number a day later.
   if (text.size() <= 10 && text.find_first_not_of("0123456789") == std::string::npos) return {};
   return "'" + text + "' is no id of a process: digits, or nothing";
 }
@@ -280,6 +289,7 @@ void addStoreOptions(CLI::App& app, RecordOptions& options) {
 void addKind(CLI::App& app, Invocation& invocation, RecordOptions& options, const std::string& kind,
              const std::string& description) {
   CLI::App* command = app.add_subcommand(kind, description);
+  // Options may stand before the kind and behind the name, since both orders are typed.
   command->fallthrough();
   command->footer("The options are those of 'tesselctl record'.");
   command

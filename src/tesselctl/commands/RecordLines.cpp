@@ -42,6 +42,7 @@ class LineReader {
       const size_t end = buffer_.find('\n', read_);
       const bool whole = end != std::string::npos;
       const std::string_view part = std::string_view(buffer_).substr(read_, end - read_);
+      // One byte more than a line may have: by that the caller sees that it is too long.
       line_ += part.substr(0, kLongestLine + 1 - std::min(line_.size(), kLongestLine + 1));
       read_ = whole ? end + 1 : buffer_.size();
       if (whole) return line_;
@@ -108,12 +109,16 @@ const char* takeNumber(RecordedPoint& point, const LineJson& value) {
   return nullptr;
 }
 
+// An id is text to the journal. Programs keep it as a number as often, and its digits are the same
+// text.
 const char* takeId(RecordedPoint& point, const LineJson& value) {
   if (!value.is_string() && !value.is_number_integer()) return "a string or an integer";
   point.id = value.is_string() ? value.get<std::string>() : value.dump();
   return nullptr;
 }
 
+// Only a boolean: "0" and "false" as texts would be true to one reader and false to another, and
+// the mark decides what leaves the machine.
 const char* takeTelemetry(RecordedPoint& point, const LineJson& value) {
   if (!value.is_boolean()) return "true or false";
   point.telemetry = value.get<bool>();

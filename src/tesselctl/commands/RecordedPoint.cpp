@@ -58,6 +58,8 @@ class FieldList {
     if (!value) return;
     const JournalField& field = journalField(kind);
     add(std::string(field.name), *value);
+    // The reader of the service judges the value here. Rules of our own would drift from what a run
+    // takes.
     const FieldToken token = reader_.tokenFor(field.name, *value, value->size());
     if (token != kNoToken && TracePointTable::kind(token) != FieldKind::malformed) return;
     complain(std::string(field.name) + ": " + inQuotes(*value) + " is not " + expectationOf(field));
@@ -123,6 +125,8 @@ class FieldList {
 
  private:
   void complain(std::string what) {
+    // The first complaint alone: whoever corrects it calls again, and later ones often follow from
+    // it.
     if (complaint_.empty()) complaint_ = std::move(what);
   }
 

@@ -29,6 +29,8 @@ struct RulesOptions {
 // A marked event. Owns the texts that the event borrows.
 class MarkedEvent {
  public:
+  // Marked, since an unmarked trace point fails before any list is asked, and the answer would be
+  // the same for each word.
   MarkedEvent(const RecordedPoint& point) : event_(fieldsFor(point), {}) {}
   const TesselEvent& event() const { return event_; }
 
@@ -75,6 +77,7 @@ StringAnswer answerFor(const TesselObject& object, size_t slot, const PlatformPr
   answer.list = listWith(answer.allowed, answer.value);
   if (answer.list == nullptr) {
     answer.near = nearValues(answer.allowed, answer.value);
+    // A value that is known elsewhere was most often checked against the wrong platform.
     for (const PlatformProfile& other : platformProfiles()) {
       if (&other != &profile && listWith(listRows(other.whitelist), answer.value) != nullptr)
         answer.elsewhere.push_back(other.name);
@@ -150,6 +153,8 @@ int runRules(const RulesOptions& options, const Surroundings& surroundings) {
     if (options.markdown) return fail(kUsage, "--markdown prints all rules; it checks nothing");
     return check(options, reading->machine, surroundings);
   }
+  // The page is compared with docs/rules.md letter for letter. An option that changed it would make
+  // a page that nothing checks.
   if (options.markdown && (options.json || options.reading.platform))
     return fail(kUsage, "--markdown prints the rules of all platforms, in one form");
   const PlatformProfile& profile = profileOf(reading->machine.platform);
@@ -209,6 +214,7 @@ void addRulesCommand(CLI::App& app, Invocation& invocation) {
       "Examples:\n"
       "  tesselctl rules check --platform Quarro vfs1.root\n"
       "  tesselctl rules check com.vantor.TextInput Keyboard Show");
+  // So `rules check VALUE --platform NAME` works: people add an option where the line ends.
   check->fallthrough();
   command.require_subcommand(0, 1);
 }

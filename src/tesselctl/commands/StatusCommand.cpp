@@ -103,6 +103,8 @@ void writeForwarder(JsonWriter& json, const ForwarderCounters& counters) {
   json.member("refused_requests", counters.refusedRequests);
   json.member("failed_requests", counters.failedRequests);
   json.member("bytes_sent", counters.bytesSent).member("position", counters.position);
+  // A 0 says that it has never succeeded. Other times are left out where they are not known, since
+  // a script would take them for dates of 1970.
   json.member("last_success", counters.lastSuccess);
   if (counters.nextAttempt != 0)
     json.member("rests_since", counters.restsSince).member("next_attempt", counters.nextAttempt);
@@ -131,6 +133,7 @@ void writeFindings(JsonWriter& json, std::string_view name, const std::vector<Fi
 std::string statusJson(const ReporterStatus& status) {
   return objectLine([&](JsonWriter& json) {
     json.member("good", status.good());
+    // The verdict comes first: whoever looks at a long line by eye wants that.
     json.member("time", status.now).member("version", TESSEL_VERSION);
     json.array("checked", status.checked, [&](FindingCode code) { json.value(findingName(code)); });
     writeFindings(json, "problems", status.findings, true);
@@ -197,6 +200,8 @@ void makeSpool(const std::string& directory) {
   const std::string path = directory + "/" + kSpoolFileName;
   if (::access(path.c_str(), F_OK) == 0) return;
   SqliteDatabase database;
+  // No patience: if another process makes the spool in this moment, there is one. A failure is seen
+  // by the next look, ten minutes later.
   openSpoolDatabase(database, path, 0);
 }
 
@@ -218,6 +223,7 @@ int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
   checkZone();
   const ReporterStatus status = gatherStatus(surroundings.launch, surroundings.now);
   const bool toFiles = options.save || options.prometheus;
+  // A timer wants no screen in the journal every ten minutes.
   if (options.json || !toFiles)
     print(options.json ? statusJson(status) : statusScreen(status, surroundings.terminal));
   flushOutput();
@@ -231,6 +237,8 @@ int runStatus(const StatusOptions& options, const Surroundings& surroundings) {
 }
 
 // Problems first, as in the list of codes.
+// The help has shorter words than docs/operating.md: a list that is longer than a screen is not
+// read.
 constexpr const char* kMeanings[] = {
     "this user may not look at the state of the service",
     "the service's user cannot read the tasking file, or it says neither yes nor no",

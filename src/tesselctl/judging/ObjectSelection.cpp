@@ -18,6 +18,7 @@ namespace {
 
 constexpr size_t kMostNear = 5;  // fit on a line
 
+// ASCII alone: a subsystem or a category hardly has other letters, and the hint needs none.
 std::string lower(std::string_view text) {
   std::string out(text);
   std::ranges::transform(out, out.begin(),
@@ -27,6 +28,8 @@ std::string lower(std::string_view text) {
 
 // How many characters must be added, removed or changed to make `b` of `a`.
 size_t editDistance(std::string_view a, std::string_view b) {
+  // One row of the table of distances is enough, because each cell needs only its left, upper and
+  // upper left neighbour. `diagonal` keeps the last of them.
   std::vector<size_t> row(b.size() + 1);
   std::iota(row.begin(), row.end(), size_t{0});
   for (size_t i = 0; i < a.size(); ++i) {
@@ -53,6 +56,8 @@ std::vector<std::string> nearWords(const std::unordered_set<std::string>& words,
       continue;
     const std::string known = lower(word);
     const size_t distance = editDistance(wanted, known);
+    // People leave out a part of a long name more often than they mistype it. So a name that holds
+    // the pattern is near however long it is.
     const bool holds = known.find(wanted) != known.npos || wanted.find(known) != wanted.npos;
     if (holds || distance <= std::max<size_t>(2, known.size() / 4))
       found.emplace_back(distance, word);
@@ -81,6 +86,8 @@ const std::array<ObjectSelection::Kind, 4> ObjectSelection::kKinds = {
 
 bool fitsOne(const std::vector<std::string>& patterns, const std::string& text) {
   return patterns.empty() ||
+         // Without flags a star matches a dot and a slash, too: in "com.vantor.*" people mean all
+         // below.
          std::any_of(patterns.begin(), patterns.end(), [&](const std::string& pattern) {
            return ::fnmatch(pattern.c_str(), text.c_str(), 0) == 0;
          });
@@ -104,6 +111,8 @@ bool ObjectSelection::chooses(const TesselObject& object, TesselReporterClassifi
     chose_ = true;
     return true;
   }
+  // Words are for the answer "nothing fits". Once something fits, nobody asks, and a day of a
+  // million objects is spared the copies.
   if (chose_) return false;
   remember(0, object.subsystem().textOr(""));
   remember(1, object.category().textOr(""));
@@ -118,6 +127,7 @@ bool ObjectSelection::choosesBegin(StringRef subsystem, StringRef category, Stri
     remember(1, category.textOr(""));
     remember(2, name.textOr(""));
   }
+  // A begin has no verdict yet. Whoever asks for one does not mean begins.
   const bool chosen = patterns_.verdicts.empty() && fitsPath(subsystem, category, name);
   choseBegin_ = choseBegin_ || chosen;
   return chosen;
@@ -136,6 +146,7 @@ std::vector<std::string> ObjectSelection::whyNone() const {
     for (const std::string& pattern : patterns_.*kKinds[kind].patterns) {
       asked = true;
       const auto fits = [&](const std::string& word) { return fitsOne({pattern}, word); };
+      // A pattern that fits something is not to blame, though another one may be.
       if (words.empty() || std::ranges::any_of(words, fits)) continue;
       std::string line = std::string(kKinds[kind].option) + " " + pattern + " fits none of " +
                          counted(words.size(), kKinds[kind].one, kKinds[kind].many);

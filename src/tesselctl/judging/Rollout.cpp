@@ -21,8 +21,11 @@ namespace tessel::ctl {
 namespace {
 
 constexpr char kFileName[] = "rollout.json";
+// A thousand times what we write. A larger file is not ours, and reading it would only cost
+// memory.
 constexpr size_t kMaxFileBytes = size_t{64} << 10;
 constexpr size_t kMaxNameBytes = 64;
+// A place is one of a million, so four decimals of a percentage name each of them.
 constexpr size_t kDecimals = 4;
 constexpr unsigned kReadableByAll = 0644;
 
@@ -44,10 +47,13 @@ std::optional<uint32_t> shareOf(std::string_view text) {
   if (!std::all_of(digits.begin(), digits.end(), isDigit)) return {};
   uint32_t parts = 0;
   std::from_chars(digits.data(), digits.data() + digits.size(), parts);
+  // 150% is no share, and taking it for the whole fleet would switch on what somebody mistyped.
   if (parts > kWholeFleet) return {};
   return parts;
 }
 
+// The name becomes a label of a metric and a word of a command line, so it holds nothing that
+// either would have to quote.
 bool isCohortName(std::string_view name) {
   return !name.empty() && name.size() <= kMaxNameBytes &&
          std::all_of(name.begin(), name.end(), [](char byte) {

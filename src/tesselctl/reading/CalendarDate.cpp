@@ -154,6 +154,8 @@ struct NamedZone {
   std::string offsetName;  // may be empty
 };
 
+// The local reading comes before the database: "IST" in India is the zone of the clocks there, and
+// not that of Israel, which another table may hold.
 std::optional<NamedZone> zoneNamed(std::string_view text, Date now) {
   if (text.empty()) return NamedZone{};
   if (const auto offset = offsetIn(text)) return NamedZone{TimeZone::fixed(*offset), {}};
@@ -183,6 +185,8 @@ std::string twice(WallTime wall, const std::vector<TimeZone::Reading>& readings)
   return error;
 }
 
+// Both corrections are offered. Which one is meant depends on whether the time was taken from a
+// clock before the change or counted on from it.
 std::string skipped(WallTime wall, const TimeZone& zone) {
   const Date change = zone.changeNear(std::chrono::floor<seconds>(wall));
   const TimeZone::Offset before = zone.at(change - seconds{1});
@@ -205,6 +209,7 @@ std::optional<sys_days> dayOf(const NamedDay& named, WallTime now) {
   if (named.date) return sys_days{*named.date};
   if (named.ofAnyYear) {
     const int thisYear = int{std::chrono::year_month_day{today}.year()};
+    // February 29 may be seven years back: a century that is no leap year lies between two of them.
     for (int year = thisYear + 1; year > thisYear - 8; --year) {
       const auto date = std::chrono::year{year} / *named.ofAnyYear;
       if (date.ok() && sys_days{date} <= today + std::chrono::days{1}) return sys_days{date};
@@ -251,6 +256,8 @@ DateResult parseCalendar(std::string_view text, Date now) {
     if (!time) return none;
     scanner = behind;
   }
+  // A name must stand apart, a distance from UTC need not: "22:45CET" is a mistyped time,
+  // "22:45+01:00" is what programs print.
   const bool apart = scanner.skip(' ');
   const std::string_view zoneText = scanner.rest();
   if (zoneText.empty() ? apart : !apart && !offsetIn(zoneText)) return none;

@@ -46,6 +46,7 @@ std::optional<microseconds> unitNamed(std::string_view word) {
     microseconds length;
     std::array<std::string_view, 5> names;
   };
+  // No month and no year: their lengths differ, and nobody can see which one a period would have.
   static constexpr Unit kUnits[] = {
       {seconds{1}, {"s", "sec", "secs", "second", "seconds"}},
       {std::chrono::minutes{1}, {"m", "min", "mins", "minute", "minutes"}},
@@ -74,6 +75,7 @@ PeriodResult wrong(std::string_view argument, std::string_view value, std::strin
   return {{}, error};
 }
 
+// We set no locale, so strftime() writes digits and the names of zones alike on each machine.
 std::string formatted(Date date, const char* format) {
   const std::time_t whole = std::chrono::floor<seconds>(date).time_since_epoch().count();
   std::tm parts{};
@@ -115,6 +117,7 @@ DateResult parseDate(std::string_view text, Date now) {
   if (text == "now") return result(now);
   if (text.starts_with('@')) return result(parseEpoch(text.substr(1)));
   if (looksLikeEpoch(text)) return result(parseEpoch(text));
+  // A bare "24h" is no date: with --until it could mean before now or after it.
   const bool ago = eatSuffix(text, " ago");
   if (ago || text.starts_with('-')) {
     if (!ago) text.remove_prefix(1);
@@ -166,6 +169,8 @@ PeriodResult periodOf(const PeriodArguments& arguments, Date now) {
   if (arguments.until) {
     const auto until = parseDate(*arguments.until, now);
     if (!until.date) return wrong("--until", *arguments.until, until.error);
+    // Whoever gives an end alone wants the day before it, as without any option he gets the day
+    // before now.
     period = {*until.date - kDay, *until.date};
   }
   if (arguments.last) {

@@ -90,6 +90,7 @@ std::string heading(const Style& style, const char* exactness, const Terminal& t
   return "\n" + line.replace(0, title.size(), terminal.paint(Colour::strong, title));
 }
 
+// One table of names serves JSON and the headings, so a quantile has the same name in both.
 std::string upper(std::string text) {
   std::ranges::transform(text, text.begin(), [](char c) { return c >= 'a' ? c - 'a' + 'A' : c; });
   return text;
@@ -240,6 +241,7 @@ std::string verdictCounts(const std::vector<DurationChange>& changes) {
   for (const DurationChange& change : changes) ++counts[static_cast<size_t>(change.verdict)];
   std::string out;
   for (size_t verdict = 0; verdict < std::size(counts); ++verdict) {
+    // "0 slower" is the answer that most people come for, so it is said.
     if (counts[verdict] == 0 && verdict != 0) continue;
     out += (out.empty() ? "" : ", ") + grouped(counts[verdict]) + " " + kVerdictTexts[verdict].text;
   }
@@ -250,6 +252,7 @@ std::string changesText(const Style& style, const Durations& a, const Durations&
                         const Terminal& terminal) {
   const uint64_t further = a.notListed(style.measure) + b.notListed(style.measure);
   const auto changes = changesBetween(a, b, style.measure);
+  // A heading above nothing would suggest that nothing became slower, though nothing was measured.
   if (changes.empty() && further == 0) return "";
   // A factor divides two percentiles, so their errors meet.
   static_assert((1 + QuantileSketch::kError) / (1 - QuantileSketch::kError) < 1.032);

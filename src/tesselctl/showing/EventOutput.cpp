@@ -18,6 +18,7 @@ using Json = nlohmann::ordered_json;
 // a discarded value is no object, so member() finds nothing in it.
 Json parsed(std::string_view payload) { return Json::parse(payload, nullptr, false); }
 
+// Anybody may have written the row, so a key may hold a number where the service writes a text.
 std::string member(const Json& payload, const char* key) {
   const auto found = payload.is_object() ? payload.find(key) : payload.end();
   return found != payload.end() && found->is_string() ? found->get<std::string>() : "";
@@ -107,6 +108,8 @@ std::string rowFields(const SpoolRow& row, const Terminal& terminal) {
 }
 
 constexpr size_t kIdWidth = 6;
+// A quarter of 80 columns. A wider name would take room from the payload, which tells the same
+// trace point and more.
 constexpr size_t kEventWidth = 22;
 
 Date timeOf(const SpoolRow& row, RowTime time) {
@@ -120,6 +123,7 @@ std::string humanLine(const SpoolRow& row, RowTime which, const Terminal& termin
   const std::string time = dateText(timeOf(row, which)).substr(5);
   std::string id = idText(event);
   id.insert(0, kIdWidth - std::min(kIdWidth, id.size()), ' ');
+  // Of one width, so that the names stand below each other.
   const std::string state = row.delivery ? "delivered" : "waits    ";
   // The payload gets the rest of the line, and one column at least on a narrow terminal.
   const size_t used = id.size() + 2 + time.size() + 2 + state.size() + 2 + kEventWidth + 2;

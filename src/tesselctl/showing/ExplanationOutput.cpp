@@ -73,6 +73,7 @@ void writeProcesses(JsonWriter& json, const TesselObject& object, const EntryPro
   writeProcess(json, "process", end, numbers);
   if (!object.isKindOf(TesselClass::interval)) return;
   const EmittingProcess& begin = static_cast<const TesselInterval&>(object).beginEvent();
+  // Two absent names are the same here: nothing is known of either, so nothing is worth a member.
   const auto same = [](StringRef a, StringRef b) {
     return a.present() ? sameString(a, b) : !b.present();
   };
@@ -80,6 +81,7 @@ void writeProcesses(JsonWriter& json, const TesselObject& object, const EntryPro
     writeProcess(json, "begin_process", begin, {});
 }
 
+// Process 0 and user 0 exist, so an unknown number is an empty field and not a zero.
 std::string numberOrNothing(std::optional<uint32_t> number) {
   return number ? std::to_string(*number) : "";
 }
@@ -93,6 +95,7 @@ std::string shownFacts(const Explanation& explanation) {
   const EntryProcess& numbers = explanation.process;
   const StringRef name = emittingProcessOf(explanation.object).name;
   if (name || numbers.id) {
+    // As `ps` and the journal write a process, name and id, so that people can paste either.
     add(shortened(terminalText(name.textOr("")), kNameWidth) +
         (numbers.id ? "[" + std::to_string(*numbers.id) + "]" : ""));
   }

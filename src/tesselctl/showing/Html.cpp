@@ -39,6 +39,8 @@ std::string withoutMiddle(std::string_view visible, size_t longest) {
 Html breakable(std::string_view shown) {
   Html html;
   while (!shown.empty()) {
+    // Names are long words of parts with dots between. A break behind a dot leaves parts that can
+    // be read.
     const size_t end = std::min(shown.find_first_of("._"), shown.size() - 1) + 1;
     html << shown.substr(0, end);
     shown.remove_prefix(end);
@@ -50,6 +52,7 @@ Html breakable(std::string_view shown) {
 // The shortest digits that name `value`.
 template <typename Number>
 void appendNumber(std::string& out, Number value) {
+  // to_chars() knows no locale: a decimal comma would break each attribute of a drawing.
   std::array<char, 32> digits{};
   const auto end = std::to_chars(digits.data(), digits.data() + digits.size(), value).ptr;
   out.append(digits.data(), end);

@@ -37,6 +37,8 @@ Html inTwoParts(std::span<const Entry> entries, const std::string& id, const std
               << table(entries, id, all, TableUse::search) << "</details>\n";
 }
 
+// Each bar has the full width, so that rows with few objects can be read as well as rows with many.
+// How many there are stands in a column of its own.
 Html pairTable(std::span<const Tally::Pair> pairs, const std::string& id,
                const std::string& caption, TableUse use, Names& names) {
   Html html;
@@ -64,6 +66,8 @@ struct MissGroup {
 // Most frequent first. Equal counts are ordered by what makes the group, as the map is.
 template <typename KeyOf>
 std::vector<MissGroup> groupedMisses(const std::vector<Tally::Miss>& misses, KeyOf&& keyOf) {
+  // A map and no hash table: its order makes equal counts stand alike on each page, so two pages
+  // can be compared.
   std::map<decltype(keyOf(misses.front())), MissGroup> groups;
   for (const Tally::Miss& miss : misses) {
     MissGroup& group = groups[keyOf(miss)];
@@ -95,6 +99,8 @@ Html missedPoints(const MissGroup& group, Names& names) {
   return html << "</ul></details>";
 }
 
+// A value is what somebody decides about: put it on a list or tell its author. So values make the
+// rows, and trace points stand beside them.
 Html missTable(std::span<const MissGroup> groups, const std::string& id, const std::string& caption,
                TableUse use, Names& names) {
   Html html;
@@ -108,6 +114,8 @@ Html missTable(std::span<const MissGroup> groups, const std::string& id, const s
   return html << tableEnd();
 }
 
+// For a page that leaves this machine. The values may hold what nobody meant to pass on, so only
+// their number stands here.
 Html missedPointTable(std::span<const MissGroup> groups, const std::string& id,
                       const std::string& caption, TableUse use, Names& names) {
   Html html;
@@ -153,6 +161,8 @@ Html quantileTable(std::span<const Durations::Row> rows, const std::string& id,
                    const Histograms& histograms, Names& names) {
   constexpr auto kNumber = Column::Kind::number;
   Html html;
+  // Seven columns do not fit a telephone. The table scrolls in a region of its own, which the
+  // keyboard can reach, and the page around it stays where it is.
   html << "<div class=\"scroll\" tabindex=\"0\" role=\"region\" aria-label=\"" << caption << "\">\n"
        << tableHead(id, Html() << caption,
                     {{"Trace point"},
@@ -182,8 +192,11 @@ Html quantileList(const Durations& durations, const MeasureWords& words, Names& 
   uint64_t negative = 0;
   Histograms histograms;
   std::vector<Durations::Row> shown;
+  // All histograms share one axis, or two rows could not be compared by eye. So we look at all rows
+  // before we draw the first.
   for (const Durations::Row& row : rows) {
     negative += row.negative;
+    // A trace point with negative values alone has no quantile to show. Its values count below.
     if (row.sketch.count() == 0) continue;
     shown.push_back(row);
     histograms.include(row.sketch);
@@ -211,6 +224,7 @@ Html quantileList(const Durations& durations, const MeasureWords& words, Names& 
 }  // namespace
 
 Html pairSection(const Tally& tally, Names& names) {
+  // The legend stands once above all bars: repeated in each row it would be most of the page.
   const auto pairs = tally.pairs();
   const auto table = [&](std::span<const Tally::Pair> some, const std::string& id,
                          const std::string& caption,

@@ -38,6 +38,8 @@ Html findingItem(const Finding& finding, const ReportFacts& facts) {
   return html << "</li>\n";
 }
 
+// The page is often looked at in place of `tesselctl status`, so it must not seem well where that
+// command says otherwise. Both take the findings from one list.
 Html findingSection(const ReportFacts& facts) {
   Html html;
   if (!facts.findings) return html;
@@ -123,6 +125,8 @@ void addCount(Html& html, std::string_view what, uint64_t count) {
   html << "<tr><th scope=\"row\">" << what << "</th><td class=\"n\">" << count << "</td></tr>\n";
 }
 
+// These counts explain why there are fewer objects than entries, which is the first thing that
+// people wonder about.
 Html readingSection(const ExtractionReport& report, const ReportFacts& facts, Names& names) {
   Html html;
   html << "<section>\n<h2>What was read</h2>\n";
@@ -217,6 +221,7 @@ Html runSection(const ReportFacts& facts, Names& names) {
     addCount(html, verdictTitle(verdict), run.classified[verdict]);
   addCount(html, "rows stored in the spool", run.rowsStored);
   html << tableEnd();
+  // A run that reported nothing by design has no sums, and "do not balance" would accuse it.
   if (run.hasBooks()) {
     const bool balanced = run.objectsBalance() && run.rowsBalance();
     html << "<p>The books "
@@ -259,6 +264,7 @@ std::string htmlReport(const Tally& tally, const ExtractionReport& report,
        << (facts.internal ? std::string_view(" with internal diagnostics") : std::string_view())
        << "</p>\n</header>\n<main>\n"
        << tiles(tally, report) << findingSection(facts) << verdictSection(tally);
+  // Charts without an object would be empty frames. The tables of zeros above say as much.
   if (tally.traceObjects() != 0) {
     html << timeSection(tally) << pairSection(tally, names)
          << missSection(

@@ -54,6 +54,7 @@ void addLosses(JsonWriter& json, const Losses& losses) {
       json.member("words", loss.words);
       if (!loss.place.name.empty()) json.member("place", loss.place.name);
       json.member("offset", loss.place.offset).member("uid", loss.place.user);
+      // One place is named already, so its number would say nothing.
       if (loss.places > 1) json.member("places", loss.places);
     });
   });

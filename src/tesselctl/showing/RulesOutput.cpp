@@ -30,6 +30,8 @@ std::vector<std::string_view> distinctValues(const StringListRow& row) {
   return values;
 }
 
+// ASCII alone: the lists hold no other letters, and the letters of a locale would make the hint
+// differ from machine to machine.
 std::string lowered(std::string_view text) {
   std::string out(text);
   for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
@@ -53,9 +55,12 @@ std::vector<std::string_view> namesOf(const ListRows& rows) {
 constexpr StringListSource kPerfLoggingLists[] = {perfLoggingComponentNames,
                                                   perfLoggingActionNames};
 
+// In the table of the build an empty text stands for any. On a screen it would look like a mistake,
+// so a star stands for it, as in patterns.
 std::string anyIfEmpty(std::string_view text) { return text.empty() ? "*" : std::string(text); }
 
 std::string shareWords(uint64_t cap, uint64_t ratio) {
+  // A cap of zero outranks the ratio: "one in 100, until 0 were" would read like a share.
   if (cap == 0) return "none is reported";
   const std::string share = ratio == 1 ? "each" : "one in " + grouped(ratio);
   return share + " is reported, until " + grouped(cap) +
@@ -63,6 +68,8 @@ std::string shareWords(uint64_t cap, uint64_t ratio) {
 }
 
 // A line of a list that programs read: its kind and its fields, as JSON or with tabs between.
+// Keys and fields stand side by side in one table, so a line and its JSON cannot tell different
+// things.
 struct Field {
   const char* key;
   std::variant<std::string_view, uint64_t> value;
@@ -157,6 +164,8 @@ void writeString(JsonWriter& json, const StringAnswer& string, bool inPoint) {
 
 // --- All rules.
 
+// The number of distinct values, as the lists show them below it. The length of the raw list would
+// not agree with what a reader counts.
 std::string listSummary(const StringListRow& row) {
   return std::string(row.name) + " (" + grouped(distinctValues(row).size()) +
          "): " + std::string(row.words);
@@ -169,6 +178,8 @@ std::string perfLoggingWords() {
          ", in every build.";
 }
 
+// The page is written by the program and compared with docs/rules.md by a test. So a list that is
+// extended cannot leave a page behind that says otherwise.
 constexpr char kPageHead[] = R"(# The rules of the build
 
 This page is the output of `tesselctl rules --markdown`.
@@ -194,6 +205,7 @@ counters live as long as the service's process: under the timer that is one run.
 |---|---|---|---|---|---|
 )";
 
+// The rows stand in the order of the build, so that the table can be held against its source.
 Table downsamplingTable(const PlatformProfile& profile) {
   Table table({{"SUBSYSTEM", Table::Align::left, true},
                {"CATEGORY", Table::Align::left, true},
@@ -217,6 +229,8 @@ ListRows listRows(std::span<const StringListSource> lists) {
   return rows;
 }
 
+// A search along the lists, not in the set of the filter: the set knows only whether a value is
+// known, and people ask where it stands. It runs once for each string of a command line.
 const StringListRow* listWith(const ListRows& rows, std::string_view value) {
   const auto found = std::ranges::find_if(rows, [&](const StringListRow* row) {
     return std::ranges::find(row->list(), value) != row->list().end();
@@ -230,6 +244,8 @@ std::vector<std::string_view> nearValues(const ListRows& rows, std::string_view 
   for (const StringListRow* row : rows) {
     for (const std::string_view known : distinctValues(*row)) {
       const std::string other = lowered(known);
+      // A value that begins alike is most often a plural or a longer form, such as "weekly" for
+      // "week". An edit distance would also offer "weak", which is another word.
       const bool shortOne = std::min(wanted.size(), other.size()) < kShortestNear;
       if (wanted == other ||
           (!shortOne && (wanted.starts_with(other) || other.starts_with(wanted))))
@@ -243,6 +259,8 @@ std::vector<std::string_view> nearValues(const ListRows& rows, std::string_view 
 std::string checkText(const CheckAnswer& answer, const Terminal& terminal) {
   const auto why = reasons(answer);
   const std::string platform(nameForPlatform(answer.machine.platform));
+  // The verdict and the platform come before the reasons: scripts count fields from the first, and
+  // the reasons are the only part of any length.
   if (!terminal.interactive) {
     return fieldsLine({answer.passes ? "passes" : "fails", std::string(answer.verdict), platform,
                        joined(why, "; ")});
@@ -279,6 +297,8 @@ std::string checkJson(const CheckAnswer& answer) {
 
 std::string rulesLines(const PlatformProfile& profile, bool json) {
   std::string out;
+  // The first profile is that of no platform. All others are listed, since the same value may pass
+  // on another one.
   for (const PlatformProfile& platform : platformProfiles().subspan<1>()) {
     out += recordLine(json, "platform",
                       {{"platform", platform.name},
@@ -317,6 +337,7 @@ std::string rulesText(const PlatformProfile& profile, bool internal, const Termi
   const auto paragraph = [&](const std::string& text, size_t indent = 0) {
     return std::string(indent, ' ') + wrappedBeside(text, terminal.width, indent) + "\n";
   };
+  // Whoever asks about another platform must see that this machine judges by other lists.
   const bool own = profile.platform == currentPlatform();
   std::string out =
       paragraph("Platform " + std::string(profile.name) + (own ? ", this build's" : "") +

@@ -27,6 +27,8 @@ class Metrics {
   void sample(std::string_view label, std::string_view labelled, uint64_t value) {
     line("{" + std::string(label) + "=\"" + std::string(labelled) + "\"}", std::to_string(value));
   }
+  // A share in parts of a million would need a rule in each dashboard. By the conventions of
+  // Prometheus a ratio goes from 0 to 1.
   void ratio(std::string_view label, std::string_view labelled, uint64_t part, uint64_t whole) {
     line("{" + std::string(label) + "=\"" + std::string(labelled) + "\"}",
          std::to_string(static_cast<double>(part) / static_cast<double>(whole)));
@@ -45,6 +47,8 @@ class Metrics {
     metric(name, "gauge", help);
     const auto microseconds = static_cast<uint64_t>(date->time_since_epoch().count());
     char text[40];
+    // Written as integers: a double of microseconds since 1970 would lose the last digits in its
+    // usual form.
     std::snprintf(text, sizeof text, "%llu.%06llu",
                   static_cast<unsigned long long>(microseconds / 1'000'000),
                   static_cast<unsigned long long>(microseconds % 1'000'000));
@@ -94,6 +98,7 @@ void addRun(Metrics& metrics, const ReporterStatus& status) {
   const RunRecord& run = *status.run;
   metrics.time("last_run_start_timestamp_seconds", "When the last run began.", run.start);
   metrics.time("last_run_end_timestamp_seconds", "When the last run ended.", run.end);
+  // A sample for each outcome, so that an alert can name one that has never occurred here.
   metrics.metric("last_run_outcome", "gauge", "How the last run ended: 1 for its outcome.");
   for (size_t at = 0; at < kRunOutcomeNames.size(); ++at)
     metrics.sample("outcome", kRunOutcomeNames[at], static_cast<size_t>(run.outcome) == at);
@@ -106,6 +111,8 @@ void addRun(Metrics& metrics, const ReporterStatus& status) {
   metrics.gauge("last_run_rows_stored", "Of those, the rows in the spool.", run.rowsStored);
   metrics.counter("rows_expired_total", "Rows that were removed because of their age.",
                   run.totals.expired);
+  // Each reason has a sample from the first run on, also where it is zero. A counter that appears
+  // only with its first loss has no increase that an alert could see.
   metrics.metric("rows_refused_total", "counter", "Rows that no run could store, by reason.");
   for (const auto& [reason, count] : run.rowsFailed) {
     const auto total = run.totals.failed.find(reason);
@@ -119,6 +126,8 @@ void addSpool(Metrics& metrics, const ReporterStatus& status) {
                 static_cast<uint64_t>(spool.rows));
   metrics.gauge("spool_rows_set_aside", "Rows that a collector refused, kept for a look.",
                 static_cast<uint64_t>(spool.setAside));
+  // Without delivered rows, which give way to new ones: with them the spool would look full when it
+  // is not.
   metrics.gauge("spool_used_bytes", "Bytes of the spool that new rows cannot have.",
                 spool.bytesOfWaiting);
   metrics.gauge("spool_limit_bytes", "Bytes that the spool may have.", status.spoolLimitBytes);

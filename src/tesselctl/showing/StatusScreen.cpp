@@ -61,8 +61,11 @@ class Screen {
     out_.erase(out_.find_last_not_of(' ') + 1);
     out_ += '\n';
   }
+  // Further words stand below the words of their line, so that the left column stays a list of
+  // questions with one answer each.
   void more(const std::string& words) { line("", "", Colour::plain, words); }
 
+  // The age saves the reader the arithmetic, and the date lets him find the moment in the journal.
   std::string since(Date date) const {
     return dateText(date) + " (" + durationText(status_.now - date) + " ago)";
   }
@@ -248,6 +251,8 @@ class Screen {
       words += ", " + dateText(Date{std::chrono::microseconds{*spool.oldest}}) + " to " +
                dateText(Date{std::chrono::microseconds{*spool.newest}});
     }
+    // Delivered rows lie in the same file. Without this word a spool of a few rows that wait would
+    // seem too large.
     if (spool.delivered != 0)
       words += "; " +
                counted(static_cast<uint64_t>(spool.delivered), "delivered row", "delivered rows") +
@@ -298,6 +303,7 @@ class Screen {
     }
   }
 
+  // "good" is worth as much as what was looked at, so each code that was looked for is named.
   std::string namesOf(const std::vector<FindingCode>& codes) const {
     std::string names;
     for (const FindingCode code : codes)
@@ -311,6 +317,7 @@ class Screen {
     for (const Finding& found : status_.findings) {
       if (!isBad(found)) inFull(found, "Note", Colour::caution);
     }
+    // Problems that follow from another one count as well: a script finds as many in the JSON.
     const auto problems = static_cast<uint64_t>(
         std::count_if(status_.findings.begin(), status_.findings.end(), isBad));
     const std::string sum = (problems == 0 ? "none" : grouped(problems)) +

@@ -143,6 +143,7 @@ std::string kindTable(const Tally& tally, const Terminal& terminal) {
   return table.render(terminal, 2);
 }
 
+// A table that is cut must say so, or its rows would be taken for all.
 std::string more(size_t listed, size_t all, std::string_view what) {
   if (all == listed) return {};
   return "  ... and " + grouped(all - listed) + " more " + std::string(what) +
@@ -205,6 +206,7 @@ std::string missTable(const Tally& tally, const Terminal& terminal) {
                {"TRACE POINT", Table::Align::left, true}});
   const auto misses = tally.misses();
   const size_t shown = std::min(misses.size(), terminal.limit(kShownMisses));
+  // The value is quoted: blanks at its ends are a frequent reason why it is not a known one.
   for (size_t at = 0; at < shown; ++at) {
     const Tally::Miss& miss = misses[at];
     table.add({terminal.number(miss.count), "\"" + terminalText(miss.value) + "\"",
@@ -243,6 +245,7 @@ Colour verdictColour(TesselReporterClassification classification) {
   return kColours[classification];
 }
 
+// Each verdict has its member, also at zero: a script that adds them up needs no list of its own.
 void addVerdicts(JsonWriter& json, const VerdictCounts& counts) {
   for (const auto verdict : kVerdictOrder) json.member(verdictName(verdict), counts[verdict]);
 }
@@ -316,6 +319,7 @@ std::string summaryText(const Tally& tally, const ExtractionReport& report,
     out += "\n" + terminal.paint(Colour::strong, "Values that are not known ones") + "\n" +
            missTable(tally, terminal);
   }
+  // What made no object comes behind what did, and losses come last, where they are seen.
   out += unpairedTable(report.assembly, terminal);
   const StoreReading& reading = report.store.reading;
   for (const std::string& note : notesOn(reading))
