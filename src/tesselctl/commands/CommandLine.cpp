@@ -116,7 +116,7 @@ std::string missing(const CLI::App& command, const CLI::Option& option) {
 std::string mismatch(const CLI::Option& option, const std::string& message) {
   const std::string name = option.get_name();
   // The parser has one kind of error for several mistakes, and only its words tell them apart. A
-  // test holds each of our messages against a command line that makes it.
+  // test holds our messages against a command line that makes it.
   if (message.find("override") != std::string::npos) return name + " takes no value";
   if (message.find("At Most") == std::string::npos) {
     const std::vector<std::string> values = valuesOf(option);

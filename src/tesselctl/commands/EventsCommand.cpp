@@ -324,6 +324,12 @@ void addEventsCommand(CLI::App& app, Invocation& invocation) {
       ->type_name("");
   show->add_flag("--json", options.json, "One JSON object: id, time, name, payload");
   addColourOption(*show, invocation);
+  // Without one of its own the parser repeats the notes of `events`, which are about lists.
+  show->footer(
+      helpText("A row that was delivered is found as well as one that waits. If the spool holds no "
+               "row of that id, the ids that it holds are named, and the exit status is 1.") +
+      "Example:\n"
+      "  tesselctl events show 42");
   command.require_subcommand(0, 1);
 }
 
