@@ -99,6 +99,7 @@ class Machine(StatusTest):
         status = json.loads(result.out)
         self.assertEqual((result.status, status["good"], [found["code"] for found in status["problems"]]),
                          (4, False, ["no_access"]))
+        self.assertRegex(self.call("tesselctl", "status", before=NOBODY).out, "Last run +no access .*Permission denied")
         self.assertNotIn("no_completed_run", status["checked"])
         for folder in (self.machine.state, self.machine.store, self.machine.config):
             os.chmod(folder, 0o755)
@@ -157,7 +158,9 @@ class Spool(StatusTest):
         late = lambda: self.spool("UPDATE events SET time = time - ?", int(3 * 3600 * 1e6))
         late()
         self.assertEqual(self.problems(), {}, "there is no forwarder")
+        self.assertRegex(self.call("tesselctl", "status").out, r"Spool +\d+ rows wait .*\nForwarder +none ")
         self.forward(Answer(401, b"who are you?"))
+        self.assertRegex(self.call("tesselctl", "status").out, r"Forwarder +in vain +0 delivered .*; the last try, .* ago\): 401: who are you\?\n")
         self.assertEqual(self.problems(), {"forwarder_stuck": None})
         self.assertEqual(self.problems(before=up_for(60)), {}, "a machine that was off could not deliver")
         self.assertRegex(self.problem("forwarder_stuck")["words"], r"nothing for 3.h, .*events wait; the last error, \d+.s ago: 401: who are you\?$")
