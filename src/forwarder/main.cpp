@@ -198,7 +198,8 @@ class Service {
     const std::chrono::nanoseconds turn{
         std::chrono::duration_cast<std::chrono::nanoseconds>(settings_.spread * chance())};
     manager_->say("Waiting for its turn in the fleet, until " + clockTime(turn));
-    forwarder_.noteRest(turn);
+    // A note takes the lock of forwarders. For the usual minutes somebody's --once may go first.
+    if (turn >= ForwarderCounters::kLongRest) forwarder_.noteRest(turn);
     bool stopped = threads_.wait(stop_, turn);
     while (!stopped) {
       const ForwarderOutcome outcome = round();

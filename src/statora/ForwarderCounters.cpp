@@ -36,10 +36,6 @@ constexpr std::string_view kLastError = "last_error";
 // Whoever may write to the spool can put any number there. Up to this one, sums cannot overflow.
 constexpr int64_t kMostCounted = int64_t{1} << 60;
 
-// `tesselctl status` allows a silence of two hours. Shorter waits need no note, and a note every 30
-// seconds would keep an idle disk awake.
-constexpr std::chrono::minutes kLongRest{10};
-
 }  // namespace
 
 std::optional<ForwarderCounters> readForwarderCounters(SqliteDatabase& database) {

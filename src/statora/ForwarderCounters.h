@@ -33,6 +33,9 @@ struct ForwarderCounters {
   uint64_t restsSince = 0;   // microseconds since 1970; 0: there was none
   uint64_t nextAttempt = 0;  // its end
 
+  // `tesselctl status` allows a silence of two hours. Shorter waits need no note, and a note every
+  // 30 seconds would keep an idle disk awake.
+  static constexpr std::chrono::minutes kLongRest{10};
   // Takes note of a wait that begins now. False if it is too short to be worth storing.
   bool rest(Date now, std::chrono::nanoseconds time);
 

@@ -40,7 +40,7 @@ class NarrowFormatter final : public CLI::Formatter {
   }
 };
 
-constexpr std::array<std::pair<std::string_view, std::string_view>, 13> kVariables = {{
+constexpr std::array<std::pair<std::string_view, std::string_view>, 14> kVariables = {{
     {"TESSEL_TRACE_STORE", "trace store, unless an option names one [the machine's journal]"},
     {"TESSEL_STATE_DIR",
      "the service's state directory, with the spool and the record of its runs "
@@ -50,6 +50,7 @@ constexpr std::array<std::pair<std::string_view, std::string_view>, 13> kVariabl
     {"TESSEL_OS_RELEASE",
      "file that says whether the build has internal diagnostics [/etc/os-release]"},
     {"TESSEL_DEFER_ON", "what may put a run off [file,battery,pressure]"},
+    {"TESSEL_DEFER_RETRY", "seconds until a run that waits begins at the latest [900]"},
     {"TESSEL_ACTIVITY_INTERVAL", "seconds between runs, where no run has noted its own"},
     {"TESSEL_SPOOL_LIMIT", "bytes that the spool may take, where no run has noted its own"},
     {"TESSEL_TRACE", "0: record nothing; check: say on standard error what is wrong"},

@@ -215,7 +215,7 @@ CommandText deferText() {
   return {"defer", "Put the service's runs off, or no longer",
           helpText("A run that is put off is offered again every 15 minutes. Written is the file "
                    "'defer' in the state directory.") +
-              helpEnvironment({"TESSEL_STATE_DIR", "TESSEL_DEFER_ON"}) +
+              helpEnvironment({"TESSEL_STATE_DIR", "TESSEL_DEFER_ON", "TESSEL_DEFER_RETRY"}) +
               "Example: keep the machine free for a measurement\n"
               "  tesselctl defer on; ./measure; tesselctl defer off"};
 }
