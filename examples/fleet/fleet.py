@@ -11,6 +11,7 @@ import argparse
 import collections
 import concurrent.futures
 import datetime
+import glob
 import math
 import os
 import shutil
@@ -203,7 +204,7 @@ def simulate(directory, arguments):
         os.mkdir(programs)
         for name in ("tessel_reporter", "statora_forwarder"):
             shutil.copy(os.path.join(arguments.programs, name), programs)
-        faketime = os.path.join(unpacked, "usr/lib/x86_64-linux-gnu/faketime/libfaketimeMT.so.1")
+        [faketime] = glob.glob(os.path.join(unpacked, "usr/lib/*/faketime/libfaketimeMT.so.1"))
         machines = [Machine(directory, number, programs, faketime) for number in range(arguments.machines)]
         began, outages = time.monotonic(), 0
         for days_ago in DAYS_AGO:

@@ -58,8 +58,10 @@ class Store:
         for name, text in (("config.xml", CONFIG), ("users.xml", USERS)):
             with open(os.path.join(self.root, name), "w", encoding="utf-8") as file:
                 file.write(text.format(port=self.port, root=self.root))
-        # Debian's packages use four folders for libraries, and the loader knows none of these.
-        libraries = [os.path.join(unpacked, top, below) for top in ("usr/lib", "lib") for below in ("x86_64-linux-gnu", "")]
+        # Debian's packages use four folders for libraries, two of them named after the machine's architecture. The loader
+        # knows none of these.
+        libraries = [path for top in ("usr/lib", "lib")
+                     for path in (*glob.glob(os.path.join(unpacked, top, "*-linux-gnu*")), os.path.join(unpacked, top))]
         self.environment = {**os.environ, "LD_LIBRARY_PATH": ":".join(libraries)}
         self.program = os.path.join(unpacked, "usr/sbin/clickhouse-server")
         self.url = f"http://127.0.0.1:{self.port}/"
