@@ -228,8 +228,8 @@ def main():
     arguments = parser.parse_args()
     # The directory is removed on Ctrl-C and SIGTERM, too.
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
-    # Not below /var/tmp: each machine has a directory of its own in its place.
-    directory = tempfile.mkdtemp(prefix="tessel-fleet-", dir="/tmp")
+    # In $TMPDIR, which `run` sets. It is not below /var/tmp: each machine has a directory of its own in its place.
+    directory = tempfile.mkdtemp(prefix="tessel-fleet-")
     try:
         return simulate(directory, arguments)
     except RuntimeError as error:
