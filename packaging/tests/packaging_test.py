@@ -103,7 +103,8 @@ class Units(unittest.TestCase):
 
     def test_the_forwarder_waits_for_an_endpoint(self):
         unit = settings(FORWARDER)
-        self.assertIn("/etc/statora/forwarder.env", unit["ConditionPathExists"])
+        self.assertEqual(unit["EnvironmentFile"], ["-/etc/statora/forwarder.env"], "a drop-in may have the settings instead")
+        self.assertIn("78", unit["RestartPreventExitStatus"], "without an address it is not started again and again")
         self.assertNotEqual(unit["User"], settings(REPORTER)["User"])
         with open(os.path.join(ROOT, "debian", "statora-forwarder.postinst"), encoding="utf-8") as script:
             self.assertNotRegex(script.read(), r"(?m)^\s*(systemctl|deb-systemd-helper) (--\S+ )*enable")

@@ -56,8 +56,9 @@ class Variables {
     return standard(name).value_or(Variable{}).value;
   }
   // Keeps the first error only: later ones often follow from it.
-  void complain(const std::string& name, const std::string& text, const std::string& expected) {
-    if (!error_) error_ = LaunchError{name, text, expected};
+  void complain(const std::string& name, std::optional<std::string> text,
+                const std::string& expected) {
+    if (!error_) error_ = LaunchError{name, std::move(text), expected};
   }
   // A whole number from `least` to 31,536,000, which is a year in seconds. A larger one is surely a
   // typing mistake, and sums of such times cannot overflow.
@@ -207,7 +208,9 @@ void readEndpoint(Variables& variables, ForwarderSettings& settings) {
   const bool allowHttp = variables.flag("TESSEL_FORWARD_ALLOW_HTTP");
   const auto endpoint = variables.standard("ENDPOINT");
   if (!endpoint) {
-    variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", "", "the URL of a collector");
+    variables.complain("OTEL_EXPORTER_OTLP_ENDPOINT", {},
+                       "the URL of a collector, in /etc/statora/forwarder.env or as Environment= "
+                       "by 'systemctl edit statora-forwarder'");
     return;
   }
   const CurlUrl url(curl_url(), &curl_url_cleanup);

@@ -69,6 +69,13 @@ TEST(ForwarderSettingsTest, HeadersArePercentDecoded) {
   EXPECT_EQ(settingsOf({}).recordsPerSecond, 100u);
 }
 
+TEST(ForwarderSettingsTest, AMissingAddressSaysWhereItBelongs) {
+  const auto result = read({});
+  EXPECT_EQ(std::get<LaunchError>(result).line(),
+            "OTEL_EXPORTER_OTLP_ENDPOINT is not set: expected the URL of a collector, in "
+            "/etc/statora/forwarder.env or as Environment= by 'systemctl edit statora-forwarder'");
+}
+
 TEST(ForwarderSettingsTest, ErrorsNameNoSecrets) {
   const struct {
     const char* name;

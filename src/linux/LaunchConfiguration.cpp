@@ -125,8 +125,9 @@ std::optional<LogLevel> logLevel(std::string_view text) {
 }  // namespace
 
 std::string LaunchError::line() const {
-  std::string shown = value.substr(0, kMaxQuotedValue);
-  if (shown.size() < value.size()) shown += "...";
+  if (!value) return variable + " is not set: expected " + expected;
+  std::string shown = value->substr(0, kMaxQuotedValue);
+  if (shown.size() < value->size()) shown += "...";
   return variable + "=\"" + plainText(shown, "\\x0a") + "\" makes no sense: expected " + expected;
 }
 

@@ -67,8 +67,8 @@ struct LaunchConfiguration {
 // A variable with an invalid value.
 struct LaunchError {
   std::string variable;
-  std::string value;
-  std::string expected;  // which values are valid
+  std::optional<std::string> value;  // absent if it must be set and is not
+  std::string expected;              // which values are valid
 
   // One line that names variable and value. It has no line feed and is fit for a terminal.
   std::string line() const;
