@@ -1,16 +1,18 @@
 #!/usr/bin/env python3
 """The forwarder where something else is wrong: a second one, settings, credentials, the clock, the reader of its output."""
 import os
+import re
 import signal
 import sqlite3
 import subprocess
+import threading
 import time
 import unittest
 
 import harness
 from faults.fault_machine import FaultMachine
 from forwarder_case import FORWARDER, ForwarderTest
-from otlp_receiver import Answer, Receiver
+from otlp_receiver import Answer, Receiver, make_certificate
 
 
 class Answers(ForwarderTest):
@@ -109,24 +111,80 @@ class Surroundings(ForwarderTest):
             self.assertEqual(result.returncode, 78)
             self.assertNotIn("secret", result.stdout + result.stderr)
 
-    def test_a_renewed_credential_is_read(self):
+    def test_renewed_credentials_are_read(self):
+        """Certificates, then the token: each old one fails, and the new one ends a wait of minutes."""
         self.add(3)
         secrets = os.path.join(self.state, "credentials")
         os.mkdir(secrets)
 
-        def write(token):
+        def write(name, text):
             with open(os.path.join(secrets, "new"), "w") as file:
-                file.write(f"authorization={token}")
-            os.rename(os.path.join(secrets, "new"), os.path.join(secrets, "otlp-headers"))
+                file.write(text)
+            os.rename(os.path.join(secrets, "new"), os.path.join(secrets, name))
 
-        write("old")
-        with Receiver(lambda request, number: Answer(200 if request.headers["authorization"] == "new" else 401)) as receiver:
-            process = subprocess.Popen([FORWARDER], env=self.environment(receiver, CREDENTIALS_DIRECTORY=secrets,
-                                                                         TESSEL_FORWARD_HOLD="86400"), stderr=subprocess.DEVNULL)
+        def content(path):
+            with open(path) as file:
+                return file.read()
+
+        (server, server_key), (client, client_key), (old, old_key) = (
+            make_certificate(self.state, name) for name in ("server", "client", "old"))
+        for name, text in (("otlp-headers", "authorization=old"), ("otlp-certificate", content(old)),
+                           ("otlp-client-certificate", content(old)), ("otlp-client-key", content(old_key))):
+            write(name, text)
+        with Receiver(lambda request, number: Answer(200 if request.headers["authorization"] == "new" else 401),
+                      certificate=server, key=server_key, client=client) as receiver:
+            process = subprocess.Popen([FORWARDER], stderr=subprocess.PIPE, text=True, env=self.environment(
+                receiver, CREDENTIALS_DIRECTORY=secrets, TESSEL_FORWARD_HOLD="86400", TESSEL_FORWARD_RETRY="86400"))
+            self.addCleanup(process.stderr.close)
             self.addCleanup(process.kill)
-            harness.wait_for(lambda: len(receiver.requests) > 0)
-            write("new")
+            self.assertRegex(process.stderr.readline(), "cannot be reached: .*certificate")
+            write("otlp-certificate", content(server))
+            self.assertRegex(process.stderr.readline(), "cannot be reached: ", "our own is refused")
+            self.assertEqual(receiver.requests, [])
+            write("otlp-client-key", content(client_key))
+            write("otlp-client-certificate", content(client))
+            while "takes nothing: 401" not in process.stderr.readline():
+                self.assertIsNone(process.poll())
+            write("otlp-headers", "authorization=new")
             harness.wait_for(lambda: not self.waiting())
+            process.terminate()
+            self.assertEqual(process.wait(60), 0)
+
+    def test_a_request_ends_after_30_s_or_10_minutes(self):
+        self.add(3)
+        clock, over = os.path.join(self.state, "clock"), threading.Event()
+        self.addCleanup(over.set)
+
+        def slow(request, number):
+            if number == 0:
+                over.wait()
+            return Answer(kind="drip" if number == 1 else "whole")
+
+        with Receiver(slow) as receiver:
+            process = subprocess.Popen([FORWARDER], stderr=subprocess.PIPE, text=True,
+                                       env=self.environment(receiver, **FaultMachine.faults(STEADY=clock)))
+            self.addCleanup(process.stderr.close)
+            self.addCleanup(process.kill)
+
+            def wakes():
+                with open(f"/proc/{process.pid}/status") as file:
+                    return int(re.search(r"voluntary_ctxt_switches:\s*(\d+)", file.read())[1])
+
+            passed = 0
+            for number, (limit, words) in enumerate(((30, "no byte has moved"), (600, "timed out"))):
+                harness.wait_for(lambda: len(receiver.requests) > number)
+                for step in range(0, limit + 15, 15):  # no step is a stall where bytes move
+                    if step < limit - 15:
+                        self.assertEqual(self.counters().get("retries", 0), number, "still within the limit")
+                    with open(clock + ".new", "w") as file:
+                        file.write(str(passed + step))
+                    os.rename(clock + ".new", clock)
+                    before = wakes()
+                    harness.wait_for(lambda: wakes() > before + 2)
+                passed += step
+                self.assertIn(words, process.stderr.readline())
+            harness.wait_for(lambda: not self.waiting())
+            self.assertEqual(len(receiver.requests), 3)
             process.terminate()
             self.assertEqual(process.wait(60), 0)
 

@@ -12,7 +12,8 @@ import otlp_protobuf
 
 
 class Answer:
-    """The answer to one request. `kind` is whole, or says where the connection breaks: cut in the body, or in the head."""
+    """The answer to one request. `kind` is whole, says where the connection breaks (cut in the body, or in the head), or is
+    drip: a byte now and then, without an end."""
 
     def __init__(self, status=200, body=b"{}", headers=(), kind="whole", delay=0.0):
         self.status, self.body, self.headers, self.kind, self.delay = status, body, dict(headers), kind, delay
@@ -53,9 +54,10 @@ def number_of(record):
 
 
 class Receiver:
-    """`script(request, number)` gives the Answer to each request; number counts from 0."""
+    """`script(request, number)` gives the Answer to each request; number counts from 0. Who connects must show the
+    certificate `client`, if there is one."""
 
-    def __init__(self, script=lambda request, number: Answer(), certificate=None, key=None):
+    def __init__(self, script=lambda request, number: Answer(), certificate=None, key=None, client=None):
         self.script, self.requests, self.accepted = script, [], []
         self._lock = threading.Lock()
         receiver = self
@@ -84,6 +86,9 @@ class Receiver:
         if certificate:
             context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
             context.load_cert_chain(certificate, key)
+            if client:
+                context.verify_mode = ssl.CERT_REQUIRED
+                context.load_verify_locations(client)
             self._server.socket = context.wrap_socket(self._server.socket, server_side=True)
         self.port = self._server.server_address[1]
         self.url = f"{'https' if certificate else 'http'}://127.0.0.1:{self.port}"
@@ -109,12 +114,15 @@ class Receiver:
         handler.send_response(answer.status)
         for name, value in answer.headers.items():
             handler.send_header(name, value)
-        handler.send_header("Content-Length", str(len(answer.body) + (100 if answer.kind == "cut" else 0)))
+        handler.send_header("Content-Length", str(len(answer.body) + {"cut": 100, "drip": 2**20}.get(answer.kind, 0)))
         if answer.kind == "head":
             handler.flush_headers()
         else:
             handler.end_headers()
             handler.wfile.write(answer.body)
+        while answer.kind == "drip":  # until the sender has gone
+            handler.wfile.write(b" ")
+            time.sleep(0.02)
         if answer.kind != "whole":
             handler.wfile.flush()
             handler.connection.shutdown(socket.SHUT_RDWR)

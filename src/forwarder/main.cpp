@@ -256,11 +256,13 @@ class Service {
 
   bool isSpoolOpen() { return state_.exists() && state_.open().ok(); }
 
-  // Waits for the next round. A renewed credential ends a hold early. True if somebody asked to
-  // stop.
+  // Waits for the next round. A renewed credential ends the wait early, because an old one may be
+  // why the collector refuses or why no connection comes about. True if somebody asked to stop.
   bool pause(ForwarderOutcome outcome) {
     std::chrono::nanoseconds left = forwarder_.pause();
-    while (outcome == ForwarderOutcome::held && left > settings_.interval) {
+    const bool byCollector =
+        outcome == ForwarderOutcome::held || outcome == ForwarderOutcome::unreachable;
+    while (byCollector && left > settings_.interval) {
       if (threads_.wait(stop_, settings_.interval)) return true;
       if (collector_.hasNewCredentials()) return false;
       left -= settings_.interval;

@@ -12,6 +12,7 @@
 //   FAULT_LINE     kills the process after it wrote this text to standard error
 //   FAULT_DURABLE  directory that receives a copy of each file whenever the file is flushed
 //   FAULT_CLOCK    file with the seconds by which the wall clock is wrong; it may appear at any time
+//   FAULT_STEADY   the same of the steady clock, of all threads. Waits last as long as they did
 //   FAULT_SLOW     milliseconds that each flush takes
 //   FAULT_HURRY    1: a wait of one and a half to three seconds ends after a millisecond. The wall
 //                  clock, the clock since boot and the steady clock of that thread jump over the
@@ -224,8 +225,8 @@ int flock(int fd, int operation) {
   return REAL(flock)(fd, operation);
 }
 
-static long clockIsWrongBy(void) {
-  const char* path = getenv("FAULT_CLOCK");
+static long clockIsWrongBy(const char* variable) {
+  const char* path = getenv(variable);
   char text[32] = "";
   if (path == NULL) return 0;
   const long file = rawOpen(path, O_RDONLY, 0);
@@ -254,10 +255,11 @@ static struct timespec timespecOf(long time) {
 int clock_gettime(clockid_t clock, struct timespec* now) {
   const int result = (int)syscall(SYS_clock_gettime, clock, now);
   if (result != 0) return result;
-  if (clock == CLOCK_REALTIME) now->tv_sec += clockIsWrongBy();
+  if (clock == CLOCK_REALTIME) now->tv_sec += clockIsWrongBy("FAULT_CLOCK");
   if (clock == CLOCK_REALTIME || clock == CLOCK_BOOTTIME)
     *now = timespecOf(nanoseconds(now) + atomic_load(&skipped));
-  if (clock == CLOCK_MONOTONIC) *now = timespecOf(nanoseconds(now) + skippedHere);
+  if (clock == CLOCK_MONOTONIC || clock == CLOCK_MONOTONIC_RAW)
+    *now = timespecOf(nanoseconds(now) + skippedHere + clockIsWrongBy("FAULT_STEADY") * kSecond);
   return 0;
 }
 
@@ -265,7 +267,8 @@ int pthread_cond_clockwait(pthread_cond_t* condition, pthread_mutex_t* mutex, cl
                            const struct timespec* until) {
   struct timespec now;
   syscall(SYS_clock_gettime, clock, &now);
-  const long deadline = nanoseconds(until) - skippedHere;
+  const long ahead = clock == CLOCK_MONOTONIC ? clockIsWrongBy("FAULT_STEADY") * kSecond : 0;
+  const long deadline = nanoseconds(until) - skippedHere - ahead;
   const long remaining = deadline - nanoseconds(&now);
   // Not the timer of the spool's flushes, which comes once a second: its jumps would hurry the
   // polls of past runs, which have the same thread.
