@@ -97,11 +97,11 @@ class ForwarderTest : public ::testing::Test {
                                         stop_, [this] { return chance_; }},
                        options_);
   }
-  // Rounds with the waits between them, as the program does them.
+  // Rounds with the waits between them, as the program does them, until nothing waits any more.
   void deliverFor(std::chrono::seconds time) {
-    for (const Date end = clock_.now() + time; clock_.now() < end;
-         clock_.advance(forwarder_->pause()))
-      deliver();
+    const Date end = clock_.now() + time;
+    while (clock_.now() < end && deliver() != ForwarderOutcome::delivered)
+      clock_.advance(forwarder_->pause());
   }
   // Refuses every body that holds one of `numbers`.
   void refuse(const std::vector<int>& numbers, long status = 400) {
@@ -119,7 +119,7 @@ class ForwarderTest : public ::testing::Test {
   int64_t waiting() { return integer("SELECT count(*) FROM events"); }
   int64_t setAside() { return integer("SELECT count(*) FROM forwarder_set_aside"); }
 
-  testing::TemporaryDirectory directory_;
+  testing::TemporaryDirectory directory_{testing::memoryDirectory()};
   testing::FakeClock clock_;
   testing::RecordingLog log_;
   LinesEncoder encoder_;
@@ -255,6 +255,8 @@ TEST_F(ForwarderTest, EachFailureMakesTheWaitLonger) {
 
 TEST_F(ForwarderTest, WhatWasTakenIsOnlyAcknowledgedAgain) {
   send(20);
+  ASSERT_TRUE(state_.open().ok());
+  state_.database().setBusyTimeout(0);  // the lock stays for as long as the forwarder waits for it
   SqliteDatabase other;
   ASSERT_TRUE(other.open(directory_.path("statora.db"), SqliteDatabase::Mode::readWrite).ok());
   collector_.status = [&other](const std::string&) {

@@ -2,6 +2,8 @@
 
 #pragma once
 
+#include <unistd.h>
+
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -14,7 +16,10 @@ namespace tessel::testing {
 
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
+  // `parent` must exist.
+  explicit TemporaryDirectory(
+      const std::filesystem::path& parent = std::filesystem::temp_directory_path())
+      : path_((parent / "tessel-test-XXXXXX").string()) {
     if (::mkdtemp(path_.data()) == nullptr) throw std::runtime_error("mkdtemp");
   }
   TemporaryDirectory(const TemporaryDirectory&) = delete;
@@ -38,7 +43,13 @@ class TemporaryDirectory {
   }
 
  private:
-  std::string path_ = (std::filesystem::temp_directory_path() / "tessel-test-XXXXXX").string();
+  std::string path_;
 };
+
+// For tests that flush files thousands of times: in memory that costs nothing.
+inline std::filesystem::path memoryDirectory() {
+  const std::filesystem::path memory = "/dev/shm";
+  return ::access(memory.c_str(), W_OK) == 0 ? memory : std::filesystem::temp_directory_path();
+}
 
 }  // namespace tessel::testing
