@@ -6,6 +6,7 @@ import re
 import stat
 
 import harness
+from faults.fault_machine import FaultMachine
 from harness import MachineTest, some_points
 from otlp_receiver import Answer, Receiver
 
@@ -37,6 +38,32 @@ class HealthRecords(MachineTest):
              "sent": rows, "stored": rows, "refused": 0}])
         self.assertTrue(all(record["start"] <= one["time"] <= record["end"] for one in others), "a run's rows have its time")
         self.assertEqual([told[key] for key in ("RowsStored", "RowsDelivered", "RowsWaiting")], [rows, rows, 0])
+
+    def test_an_outage_hides_no_run(self):
+        self.machine.write_export(some_points(2))
+        clock, away = os.path.join(self.machine.root, "clock"), True
+        with Receiver(lambda request, number: Answer(503 if away else 200)) as receiver:
+            self.run_clean()
+            process = self.machine.start("statora_forwarder", OTEL_EXPORTER_OTLP_ENDPOINT=receiver.url, TESSEL_FORWARD_SPREAD="0",
+                                         TESSEL_FORWARD_RETRY="1", TESSEL_FORWARD_INTERVAL="1", TESSEL_FORWARD_HEALTH="1",
+                                         **FaultMachine.faults(CLOCK=clock))
+            self.addCleanup(process.kill)
+
+            def waiting_runs():
+                return [json.loads(dict(payload)["Runs"]) for name, payload in self.machine.rows() if name == "tessel.health"]
+
+            harness.wait_for(lambda: [len(runs) for runs in waiting_runs()] == [1])
+            self.run_clean()
+            self.run_clean()
+            with open(clock, "w", encoding="utf-8") as file:
+                file.write("3700")
+            harness.wait_for(lambda: [len(runs) for runs in waiting_runs()] == [3])
+            away = False
+            harness.wait_for(lambda: not self.machine.rows())
+            process.terminate()
+            self.assertEqual(self.machine.result(process).status, 0)
+        *_, told = [one["payload"] for one in self.sent() if one["name"] == "tessel.health"]
+        self.assertEqual((len(json.loads(told["Runs"])), told["RunsMissing"]), (3, 0))
 
     def test_switched_off_a_waiting_record_is_removed(self):
         self.machine.write_export(some_points(1))

@@ -2,6 +2,10 @@
 //
 // The payload is flat, because every format that we send can carry that. The runs are the one list
 // in it, so they stand as JSON in a text.
+//
+// A collector that has all records must know every run, however long it was away. So each record
+// tells all runs that no collector has heard of. The service keeps notes of the last 256. A record
+// that waits while more runs begin keeps its place, and the next one tells the runs behind it.
 
 #include "forwarder/Health.h"
 
@@ -100,9 +104,9 @@ SavedStatus readSavedStatus(const std::string& directory) {
 // The runs that a record tells: those that no collector has heard of.
 struct RunsToTell {
   std::vector<RunNote> runs;
-  uint64_t last = 0;  // the number of the newest of them; of the last one told if there are none
-  uint64_t missing =
-      0;  // runs between the last one told and the first of `runs`: nobody knows them
+  RunRange numbers;  // of `runs`
+  // Runs between the last one told and the first of `runs`. Nobody knows them any more.
+  uint64_t missing = 0;
 };
 
 // The last run may be under way, so it is told when it has an end, or when another one has begun.
@@ -110,17 +114,28 @@ RunsToTell runsAfter(const RunHistory& history, uint64_t taken) {
   // Somebody has removed the file with the count, and it began anew.
   if (taken > history.begun) taken = 0;
   RunsToTell told;
-  told.last = taken;
+  told.numbers = {taken + 1, taken};
   uint64_t number = history.begun - history.runs.size();
   for (const RunNote& note : history.runs) {
     ++number;
     const bool mayBeUnderWay = !note.end && &note == &history.runs.back();
     if (number <= taken || mayBeUnderWay) continue;
-    if (told.runs.empty() && taken != 0) told.missing = number - taken - 1;
+    if (told.runs.empty()) {
+      if (taken != 0) told.missing = number - taken - 1;
+      told.numbers.first = number;
+    }
     told.runs.push_back(note);
-    told.last = number;
+    told.numbers.last = number;
   }
   return told;
+}
+
+// Whether the record that waits tells a run which is in no note any more: more runs have begun
+// since than there are notes, or somebody has removed the file. A new record in its place would
+// lose that run.
+bool aloneKnowsARun(const RunRange& waiting, const RunHistory& history) {
+  const uint64_t oldest = history.begun - history.runs.size() + 1;
+  return waiting.first <= waiting.last && (waiting.first < oldest || waiting.last > history.begun);
 }
 
 // Every run has every key, so that even a pattern can take the text apart. A run that died has no
@@ -211,13 +226,15 @@ bool Health::look(Date now) {
   auto read = readRunHistory(stateDirectory_);
   auto* const found = std::get_if<RunHistory>(&read);
   const RunHistory history = found != nullptr ? std::move(*found) : RunHistory{};
-  const RunsToTell told = runsAfter(history, last.runTaken);
-  const std::string facts = factsOf(status, told.last);
+  const bool keep = last.waiting && aloneKnowsARun(*last.waiting, history);
+  const RunsToTell told = runsAfter(history, keep ? last.waiting->last : last.runTaken);
+  const std::string facts = factsOf(status, told.numbers.last);
   if (!isDue(last, facts, now)) return false;
   const auto books = ledger.books();
   if (!books) return false;
   const std::string payload = payloadOf(status, history, told, *books, state_.counters());
-  return ledger.put(payload, facts, told.last, now).ok();
+  const auto before = keep ? HealthLedger::Before::kept : HealthLedger::Before::replaced;
+  return ledger.put(payload, facts, told.numbers, before, now).ok();
 }
 
 void Health::withdraw() { HealthLedger(state_.database()).withdrawAll(); }

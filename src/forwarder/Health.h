@@ -2,7 +2,7 @@
 //
 // A health record is an event of its own, tessel.health. It has codes and counts: what `tesselctl
 // status` finds, the runs, and what became of the rows. It has no text of the journal. A record is
-// made once a day, and when something has changed, but at most once an hour.
+// made once a day, and when something has changed, but at most once an hour; in an outage, too.
 //
 // Threads: one at a time.
 

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <nlohmann/json.hpp>
+#include <numeric>
 
 #include "linux/RunRecordFile.h"
 #include "linux/StateDirectory.h"
@@ -41,6 +42,14 @@ class HealthTest : public ::testing::Test {
     begin();
     ASSERT_FALSE(writeRunRecord(record, directory_.path()));
   }
+  // What runs would leave that were killed, and one that is under way: their notes.
+  void died(uint64_t count) {
+    Json runs = Json::array();
+    const uint64_t notes = std::min<uint64_t>(count, RunHistory::kMaxRuns);
+    for (uint64_t start = count - notes; start < count; ++start)
+      runs.push_back({{"start", start}, {"boot", ""}});
+    directory_.write("last_run.json", Json{{"runs_begun", count}, {"runs", runs}}.dump());
+  }
   void begin() { ASSERT_FALSE(writeRunBegin(now_, "none", directory_.path())); }
   bool lookAfter(minutes time) { return health_.look(now_ += time); }
   // The collector takes all that waits. Answers the health records among it.
@@ -69,7 +78,7 @@ class HealthTest : public ::testing::Test {
     return found;
   }
 
-  testing::TemporaryDirectory directory_;
+  testing::TemporaryDirectory directory_{testing::memoryDirectory()};
   SqliteDatabase service_;
   ForwarderState state_{directory_.path()};
   Health health_{directory_.path(), state_};
@@ -140,13 +149,49 @@ TEST_F(HealthTest, EachRunIsToldUntilACollectorTookIt) {
   };
   EXPECT_EQ(record.at("RowsStored"),
             sum({"RowsDelivered", "RowsWaiting", "RowsSetAside", "RowsWithdrawn"}));
-  for (size_t each = 0; each < RunHistory::kMaxRuns + 3; ++each) run(1);
+  died(4 + RunHistory::kMaxRuns + 3);
   ASSERT_TRUE(lookAfter(hours{1}));
   record = delivered();
-  EXPECT_EQ(outcomes(record).size(), RunHistory::kMaxRuns);
+  EXPECT_EQ(outcomes(record).size(), RunHistory::kMaxRuns - 1);
   EXPECT_EQ(record.at("RunsMissing"), 3) << "what is not known is said to be missing";
   ASSERT_TRUE(lookAfter(hours{24}));
   EXPECT_EQ(delivered().at("Runs"), "[]");
+}
+
+TEST_F(HealthTest, AnOutageOfManyRunsHidesNone) {
+  std::vector<uint64_t> told;
+  const auto collect = [&](size_t records) {
+    const std::vector<Json> taken = deliver();
+    EXPECT_EQ(taken.size(), records);
+    for (const Json& record : taken) {
+      EXPECT_EQ(record.at("RunsMissing"), 0);
+      for (const Json& each : Json::parse(record.at("Runs").get<std::string>()))
+        told.push_back(each.at("start"));
+    }
+  };
+  const auto all = [](uint64_t count) {
+    std::vector<uint64_t> numbers(count);
+    std::iota(numbers.begin(), numbers.end(), uint64_t{0});
+    return numbers;
+  };
+  for (uint64_t begun = 100; begun <= 1000; begun += 100) {
+    died(begun);
+    ASSERT_TRUE(lookAfter(hours{1}));
+  }
+  collect(5);
+  EXPECT_EQ(told, all(999)) << "the last one may be under way";
+  died(1002);
+  ASSERT_TRUE(lookAfter(hours{1}));
+  collect(1);
+  EXPECT_EQ(told, all(1001));
+  // Somebody removes the file while a record waits.
+  told.clear();
+  died(1003);
+  ASSERT_TRUE(lookAfter(hours{1}));
+  died(3);
+  ASSERT_TRUE(lookAfter(hours{1}));
+  collect(2);
+  EXPECT_EQ(told, (std::vector<uint64_t>{1001, 0, 1}));
 }
 
 TEST_F(HealthTest, WithdrawnRecordsNeverLeave) {

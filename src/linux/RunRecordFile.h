@@ -1,5 +1,5 @@
 // The past runs on disk: `<state>/last_run.json` holds the record of the last run, and the notes of
-// the last 32.
+// the last 256.
 //
 // Stateless; any thread.
 
@@ -17,11 +17,11 @@ namespace tessel {
 
 std::string runRecordPath(const std::string& stateDirectory);
 
-// Our records have an eighth of this at most, so a larger one of a later service can still be
+// Our records have a quarter of this at most, so a larger one of a later service can still be
 // read. The bound keeps a file that somebody else put there from filling the memory.
 inline constexpr size_t kMaxRunRecordBytes = size_t{1} << 20;
 
-// Both replace the file as a whole. It stays below 128 KiB whatever the store holds, because the
+// Both replace the file as a whole. It stays below 256 KiB whatever the store holds, because the
 // list of losses is bounded and long texts lose their middle. The error is absent if that
 // succeeded. REQUIRES: the caller holds the lock of the state directory.
 //

@@ -148,9 +148,10 @@ struct RunNote {
 };
 
 struct RunHistory {
-  // A collector may be away for as long as rows wait for it, which is 30 days by default. The
-  // forwarder then still tells it of each daily run.
-  static constexpr size_t kMaxRuns = 32;
+  // Nobody can tell the collector of a run whose note is gone, and the forwarder may be away for
+  // long. So the notes reach back eight months of daily runs, and each run writes the file twice:
+  // 256 notes make it 90 KiB longer.
+  static constexpr size_t kMaxRuns = 256;
 
   std::vector<RunNote> runs;      // the last ones, oldest first
   uint64_t begun = 0;             // runs that were ever noted: the number of the last one

@@ -16,8 +16,9 @@ namespace {
 constexpr std::string_view kRow = "health_row";          // id of the last record
 constexpr std::string_view kMade = "health_made";        // microseconds since 1970
 constexpr std::string_view kFacts = "health_facts";      // a text
-constexpr std::string_view kRun = "health_run";          // number of the last run it tells
-constexpr std::string_view kTaken = "health_run_taken";  // the same, of the last one taken
+constexpr std::string_view kFirst = "health_run_first";  // numbers of the runs that it tells
+constexpr std::string_view kRun = "health_run";
+constexpr std::string_view kTaken = "health_run_taken";  // the last run of the last one taken
 constexpr std::string_view kWithdrawn = "health_withdrawn";
 
 }  // namespace
@@ -53,6 +54,12 @@ LastHealth HealthLedger::last() {
       " AND NOT EXISTS (SELECT 1 FROM events WHERE id=row.value)"
       " AND NOT EXISTS (SELECT 1 FROM forwarder_set_aside WHERE id=row.value)");
   last.runTaken = count(taken ? kRun : kTaken);
+  const bool waits = database_
+                         .integer(
+                             "SELECT 1 FROM forwarder JOIN events ON events.id=forwarder.value"
+                             " WHERE forwarder.name='health_row' AND events.name='tessel.health'")
+                         .has_value();
+  if (waits) last.waiting = RunRange{count(kFirst), count(kRun)};
   return last;
 }
 
@@ -74,14 +81,21 @@ std::optional<SpoolBooks> HealthLedger::books() {
   return books;
 }
 
-SqliteStatus HealthLedger::put(std::string_view payload, std::string_view facts, uint64_t lastRun,
-                               Date now) {
+SqliteStatus HealthLedger::put(std::string_view payload, std::string_view facts, RunRange runs,
+                               Before before, Date now) {
   if (SqliteStatus begun = database_.execute("BEGIN IMMEDIATE"); !begun.ok()) return begun;
-  const uint64_t runTaken = last().runTaken;
+  // What a kept record tells will arrive, so it counts as taken.
+  const LastHealth was = last();
+  const bool kept = before == Before::kept && was.waiting;
+  const uint64_t runTaken = kept ? was.waiting->last : was.runTaken;
   const int64_t time = now.time_since_epoch().count();
-  SqliteStatement remove = database_.prepare("DELETE FROM events WHERE id=?1 AND name=?2");
-  bool good = remove.prepared() && remove.bind(1, number(kRow)).bind(2, kHealthEvent).run();
-  const int64_t withdrawn = number(kWithdrawn) + (good ? database_.changes() : 0);
+  int64_t withdrawn = number(kWithdrawn);
+  bool good = true;
+  if (!kept) {
+    SqliteStatement remove = database_.prepare("DELETE FROM events WHERE id=?1 AND name=?2");
+    good = remove.prepared() && remove.bind(1, number(kRow)).bind(2, kHealthEvent).run();
+    withdrawn += good ? database_.changes() : 0;
+  }
   SqliteStatement insert =
       database_.prepare("INSERT INTO events(time, name, payload) VALUES(?1, ?2, ?3)");
   good = good && insert.prepared() &&
@@ -90,7 +104,8 @@ SqliteStatus HealthLedger::put(std::string_view payload, std::string_view facts,
   SqliteStatement text = database_.prepare("INSERT OR REPLACE INTO forwarder VALUES(?1, ?2)");
   good = good && text.prepared() && text.bind(1, kFacts).bind(2, facts).run() &&
          remember(kRow, row) && remember(kMade, time) && remember(kWithdrawn, withdrawn) &&
-         remember(kRun, static_cast<int64_t>(lastRun)) &&
+         remember(kFirst, static_cast<int64_t>(runs.first)) &&
+         remember(kRun, static_cast<int64_t>(runs.last)) &&
          remember(kTaken, static_cast<int64_t>(runTaken));
   return finish(good);
 }

@@ -1,9 +1,10 @@
 // HealthLedger: the forwarder's own event, tessel.health, among the rows of the spool.
 //
 // A health record is a row of `events`, so the forwarder delivers it like every other row: under
-// the same identifier each time, with the same waits, and with a copy in `forwarder_delivered`. At
-// most one waits. A newer record takes its place, because only the latest state of a machine counts
-// and a collector that was away for a week wants no week of them.
+// the same identifier each time, with the same waits, and with a copy in `forwarder_delivered`. A
+// newer record takes the place of one that still waits, because only the latest state of a machine
+// counts and a collector that was away for a week wants no week of them. One that alone knows of a
+// run waits on.
 //
 // What the ledger remembers stands in the table `forwarder`, in the transaction that inserts the
 // row. So after a kill the next forwarder neither repeats a record nor leaves one out.
@@ -33,12 +34,20 @@ struct SpoolBooks {
   uint64_t withdrawn = 0;  // health records that a newer one replaced
 };
 
+// The numbers of the runs that a record tells: none if `last` is below `first`.
+struct RunRange {
+  uint64_t first = 1;
+  uint64_t last = 0;
+};
+
 // The last health record of this spool.
 struct LastHealth {
   Date made{};        // 1970 if there was none
   std::string facts;  // see HealthLedger::put()
-  // The number of the newest run that a record told which a collector has taken.
+  // The number of the newest run that was told by a record which a collector has taken, or by one
+  // that waits and keeps its place.
   uint64_t runTaken = 0;
+  std::optional<RunRange> waiting;  // of the last record. Absent if it does not wait
 };
 
 class HealthLedger {
@@ -50,10 +59,12 @@ class HealthLedger {
   LastHealth last();
   // Absent if the spool cannot be read.
   std::optional<SpoolBooks> books();
-  // Lets a record wait for delivery in the place of one that still waits. The ledger remembers
-  // `facts`, by which the caller sees later whether anything has changed, and `lastRun`, the number
-  // of the newest run that the record tells.
-  SqliteStatus put(std::string_view payload, std::string_view facts, uint64_t lastRun, Date now);
+  // What becomes of the last record if it still waits.
+  enum class Before { replaced, kept };
+  // Lets a record wait for delivery. The ledger remembers `facts`, by which the caller sees later
+  // whether anything has changed, and the runs that the record tells.
+  SqliteStatus put(std::string_view payload, std::string_view facts, RunRange runs, Before before,
+                   Date now);
   // Removes what waits, and forgets that there were records. Does nothing if there were none.
   SqliteStatus withdrawAll();
 

@@ -109,6 +109,8 @@ void lookAtRuns(ReporterStatus& status, const StateDirectory& state) {
   auto read = readRunHistory(state.path());
   if (auto* history = std::get_if<RunHistory>(&read)) {
     status.runs = std::move(history->runs);
+    if (status.runs.size() > ReporterStatus::kMaxRuns)
+      status.runs.erase(status.runs.begin(), status.runs.end() - ReporterStatus::kMaxRuns);
     status.run = std::move(history->last);
   } else {
     status.recordFailure = std::get<PlatformError>(std::move(read));

@@ -87,7 +87,8 @@ struct ReporterStatus {
   std::optional<Date> deferredSince;    // since when the machine or the defer file wants one
   // The unit's first, if this machine has its directory; then that of a run by hand.
   std::vector<Marker> markers;
-  std::vector<RunNote> runs;  // the last ones, oldest first
+  static constexpr size_t kMaxRuns = 32;  // a month of daily runs
+  std::vector<RunNote> runs;              // the last ones, oldest first
   std::optional<RunRecord> run;
   std::optional<PlatformError> recordFailure;  // why the record is not used
   std::optional<Date> recordWritten;           // when its file was written
