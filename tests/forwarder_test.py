@@ -3,7 +3,6 @@
 import email.utils
 import json
 import os
-import random
 import shutil
 import signal
 import socket
@@ -275,34 +274,6 @@ class Process(ForwarderTest):
             harness.wait_for(lambda: len(receiver.requests) == 2 and not self.waiting())
             process.terminate()
             self.assertEqual(process.wait(60), 0)
-
-    def test_killed_at_any_moment_it_loses_nothing(self):
-        total = 20_000
-        self.add(total)
-        chooser = random.Random()
-        with Receiver() as receiver:
-            for _ in range(50):
-                process = subprocess.Popen([FORWARDER], env=self.environment(receiver))
-                time.sleep(chooser.uniform(0.005, 0.06))
-                process.kill()
-                process.wait()
-                with sqlite3.connect(self.path) as database:
-                    self.assertEqual(database.execute("PRAGMA integrity_check").fetchone()[0], "ok")
-                    if database.execute("SELECT 1 FROM sqlite_schema WHERE name='forwarder_delivered'").fetchone():
-                        rows = database.execute("SELECT id FROM forwarder_delivered UNION ALL SELECT id FROM events ORDER BY 1")
-                        self.assertEqual([id for (id,) in rows], list(range(1, total + 1)), "each row stands once")
-                if self.waiting() < 2000:  # so that every kill finds work
-                    self.add(2000)
-                    total += 2000
-            self.assertEqual(self.run_forwarder(receiver).returncode, 0, self.errors)
-        texts = {}
-        for request in receiver.requests:
-            for record in request.records:
-                texts.setdefault(uid_of(record), set()).add(json.dumps(record))
-        self.assertEqual(len(texts), total)
-        self.assertTrue(all(len(kinds) == 1 for kinds in texts.values()), "the same identifier is the same record")
-        self.assertEqual(self.query("SELECT id FROM forwarder_delivered ORDER BY number"),
-                         [(number,) for number in range(1, total + 1)], "a copy of each, and one only")
 
 
 if __name__ == "__main__":
