@@ -16,14 +16,16 @@
 // selects a line, and so neighbours in the file have neighbouring lines. A hash would spread them,
 // but ids are stored in the order of the file and asked for in nearly the same order. The line of
 // an id has several ids that come soon after it, so they share one look into main memory.
-// What was stored or found last stands first in its line; a new value pushes out the last.
+// In both a new value stands first in its line and pushes out the last. A recurring value that is
+// found moves to the front. A value that was awaited has been found then, so it moves to the end:
+// if it stayed, values that are still awaited would be pushed out in its place, one in seventy.
 //
 // A slot must never return the token of another object: that would put a wrong value into an event.
 // So a slot also holds the key, or the part of it that does not select the line. The key is the
 // number of the file and the offset. A recurring value is looked up for nearly every field, so its
 // slot has the whole key: one addition makes it, and its own bits select the line. A slot of the
 // other table has a tag of 32 bits, so that a line has five slots and not four. Four would be too
-// few: one id in fifty would be read again.
+// few: one id in a hundred would be read again.
 //
 // Threads: one at a time.
 
@@ -31,6 +33,7 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <iterator>
 #include <memory>
 
 #include "journal/EntryStream.h"
@@ -48,12 +51,6 @@ class TokenCache {
   static constexpr int kFileBits = 13;
   static constexpr int kOffsetBits = 33;
 
-  // Moves what is at `found` to the front of its line.
-  template <typename Slot>
-  static const Value* bringForward(Slot* line, Slot* found) {
-    std::rotate(line, found, found + 1);
-    return &line->value;
-  }
   template <typename Slot, size_t kSlots>
   static void pushInto(Slot (&line)[kSlots], const Slot& slot) {
     std::copy_backward(line, line + kSlots - 1, line + kSlots);
@@ -138,11 +135,8 @@ class TokenCache {
 
   // Forgets all tokens if they are of another generation than `generation`.
   void useGeneration(uint32_t generation) {
-    if (generation == generation_) [[likely]]
-      return;
-    generation_ = generation;
-    recurring_.clear();
-    awaited_.clear();
+    if (generation != generation_) [[unlikely]]
+      forgetAll(generation);
   }
 
   // The view of one file. Valid while the cache lives; cheap enough to make for every entry. Except
@@ -169,12 +163,18 @@ class TokenCache {
     // What is remembered, or null.
     const Value* find(uint64_t offset) const {
       auto& recurring = Recurring::lineOf(lines_, base_ + offset);
-      for (Recurring::Slot& slot : recurring)
-        if (slot.key == base_ + offset) return bringForward(recurring, &slot);
+      for (Recurring::Slot& slot : recurring) {
+        if (slot.key != base_ + offset) continue;
+        std::rotate(recurring, &slot, &slot + 1);
+        return &recurring[0].value;
+      }
       auto& awaited = cache_.awaited_.lineOf(file_, offset);
       const uint32_t tag = Awaited::tagOf(file_, offset);
-      for (Awaited::Slot& slot : awaited)
-        if (slot.tag == tag) return bringForward(awaited, &slot);
+      for (Awaited::Slot& slot : awaited) {
+        if (slot.tag != tag) continue;
+        std::rotate(&slot, &slot + 1, std::end(awaited));
+        return &std::rbegin(awaited)->value;
+      }
       return nullptr;
     }
     // Both REQUIRE that nothing is remembered.
@@ -194,6 +194,13 @@ class TokenCache {
   };
 
  private:
+  // Not inlined: the empty lines that it copies would widen the stack of each entry.
+  [[gnu::noinline]] void forgetAll(uint32_t generation) {
+    generation_ = generation;
+    recurring_.clear();
+    awaited_.clear();
+  }
+
   uint32_t generation_ = 0;
   Recurring recurring_;
   Awaited awaited_;
