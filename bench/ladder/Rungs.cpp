@@ -26,7 +26,10 @@ class Glance final : public FieldTokenizer {
   FieldToken tokenFor(std::string_view name, std::string_view, uint64_t) override {
     return wants(name) ? 1 : kNoToken;
   }
-  uint32_t generation() const override { return 0; }
+  const uint32_t& generation() const override { return generation_; }
+
+ private:
+  uint32_t generation_ = 0;
 };
 
 [[noreturn]] void fail(const std::string& why) {
@@ -44,7 +47,7 @@ uint64_t readAlone(const std::string& directory) {
   size_t tokens = 0;
   while (entries.next()) {
     ++count;
-    tokens += entries.entry().tokens.size();
+    tokens += entries.tokens().size();
   }
   if (tokens == 0) fail("no tokens");
   return count;

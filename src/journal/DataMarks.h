@@ -73,7 +73,7 @@ class DataMarks {
   // Looks at the first bytes of the text of the data object at `offset`, kMaxMark of them or the
   // whole text, and remembers whether it is a mark. Answers `unknown` if it is none, but there is
   // no memory left to remember that.
-  State see(uint64_t offset, std::string_view head) {
+  [[gnu::always_inline]] State see(uint64_t offset, std::string_view head) {
     const uint64_t first = firstWord(head);
     bool candidate = false;
     for (const Mark& one : marks_) candidate |= (first & one.mask) == one.word;

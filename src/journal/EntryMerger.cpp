@@ -126,7 +126,8 @@ bool StoreMerger::findLeader(bool more) {
   leader_ = &merger.leader();
   leaderNumber_ = merger.leaderNumber();
   header_ = &leader_->header();
-  rivalInSequence_ = sequence_ != nullptr ? sequence_->rival() : nullptr;
+  const EntryHeader* const inSequence = sequence_ != nullptr ? sequence_->rival() : nullptr;
+  rivalNumber_ = inSequence != nullptr ? inSequence->sequenceNumber : UINT64_MAX;
   rival_ = all_.rival();
   leads_ = comesFirst();
   return true;

@@ -64,7 +64,7 @@ class EntryMerger final : public EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return *heap_.front().header; }
-  Entry entry() override { return heap_.front().stream->entry(); }
+  std::span<const FieldToken> tokens() override { return heap_.front().stream->tokens(); }
   // The stream of the current entry, and its number. REQUIRES: next() answered true.
   EntryStream& leader() const { return *heap_.front().stream; }
   uint32_t leaderNumber() const { return heap_.front().number; }
@@ -127,7 +127,7 @@ class StoreMerger final : public EntryStream {
     return nextOfAll();
   }
   const EntryHeader& header() const override { return *header_; }
-  Entry entry() override { return leader_->entry(); }
+  std::span<const FieldToken> tokens() override { return leader_->tokens(); }
   // Number of the stream that the current entry is from. REQUIRES: next() answered true.
   uint32_t streamNumber() const { return leaderNumber_; }
   // How many copies of entries it left out so far.
@@ -140,7 +140,7 @@ class StoreMerger final : public EntryStream {
   void addSequence(Streams& streams);
   // Whether the current entry comes before those of all other streams. Not if it is equal to one.
   bool comesFirst() const {
-    return (rivalInSequence_ == nullptr || comesBefore(*header_, *rivalInSequence_)) &&
+    return header_->sequenceNumber < rivalNumber_ &&
            (rival_ == nullptr || comesBefore(*header_, *rival_));
   }
   bool nextOfAll();
@@ -153,13 +153,14 @@ class StoreMerger final : public EntryStream {
   // In all_, sequence i has the number kFirstSequence + i; all_ owns it.
   std::vector<EntryMerger*> sequences_;
   EntryMerger all_;
-  // Of the current entry: its file, the merger of its sequence or null, and the entries that come
-  // next of the other files of the sequence and of all others, or null.
+  // Of the current entry: its file, the merger of its sequence or null, and what comes next of the
+  // others: the number of that entry in the other files of the sequence, or no number if there is
+  // none; and the entry of all other files, or null. In a sequence the number alone decides.
   EntryStream* leader_ = nullptr;
   uint32_t leaderNumber_ = 0;
   const EntryHeader* header_ = nullptr;
   EntryMerger* sequence_ = nullptr;
-  const EntryHeader* rivalInSequence_ = nullptr;
+  uint64_t rivalNumber_ = UINT64_MAX;
   const EntryHeader* rival_ = nullptr;
   bool leads_ = false;  // the current entry comes before those of all other streams
 };

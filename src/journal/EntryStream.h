@@ -67,8 +67,9 @@ class FieldTokenizer {
   // Changes when the tokenizer forgets all its texts to stay within its memory. All tokens that it
   // returned before are then void. A reader compares it before it collects the tokens of an entry
   // and shows the texts again if it changed. It changes only between two entries: from the call of
-  // EntryStream::entry() until its user is done with the tokens, every token is good.
-  virtual uint32_t generation() const = 0;
+  // EntryStream::tokens() until its user is done with the tokens, every token is good. A reader
+  // keeps the reference, which is valid as long as the tokenizer, and looks at the number there.
+  virtual const uint32_t& generation() const = 0;
 };
 
 // When an entry was written, and its place in the journal's order.
@@ -95,10 +96,13 @@ class EntryStream {
   virtual ~EntryStream() = default;
   // Moves to the next entry. False at the end, or soon after the stop flag was set.
   virtual bool next() = 0;
-  // Both REQUIRE that the last next() returned true. header() costs nothing. entry() collects the
-  // tokens, so a caller that only counts or skips the entry does not call it.
+  // All REQUIRE that the last next() returned true. header() costs nothing. tokens() collects the
+  // tokens, so a caller that only counts or skips the entry does not call it. They are valid until
+  // the next call of next(). A span is returned in registers; an Entry takes its way through
+  // memory, so no stream returns one.
   virtual const EntryHeader& header() const = 0;
-  virtual Entry entry() = 0;
+  virtual std::span<const FieldToken> tokens() = 0;
+  Entry entry() { return {header(), tokens()}; }
 };
 
 // The cursor of an entry: a text that identifies the entry and that `journalctl --cursor=` accepts.

@@ -40,8 +40,9 @@ class EntryChain {
   // Reads the main chain of `file`. Both must outlive the chain.
   EntryChain(JournalFile& file, const StopFlag& stop);
 
-  // The next offset; 0 at the end of the chain, or soon after the stop flag was set.
-  uint64_t next() {
+  // The next offset; 0 at the end of the chain, or soon after the stop flag was set. Asked for
+  // every entry, so it is inlined, and what happens once in 512 entries is not.
+  [[gnu::always_inline]] uint64_t next() {
     while (pieceNext_ == pieceSize_) [[unlikely]] if (!loadPiece()) return 0;
     const uint64_t offset = itemAt(pieceNext_++);
     return offset != 0 ? offset : endAtZero();
@@ -54,9 +55,9 @@ class EntryChain {
   uint64_t last();
 
  private:
-  bool loadPiece();
+  [[gnu::noinline]] bool loadPiece();
   bool enterArray(uint64_t offset);
-  uint64_t endAtZero();
+  [[gnu::noinline]] uint64_t endAtZero();
   bool end();
   uint64_t itemAt(size_t index) const {
     const uint8_t* item = piece_.get() + index * itemSize_;
@@ -111,8 +112,8 @@ class EntryWalk {
   ObjectHeader objectAt(uint64_t offset);
   bool takeListed();
   [[gnu::noinline]] bool take(uint64_t offset);
-  void accept(uint64_t offset, uint64_t size);
-  void compareWithList(uint64_t offset);
+  [[gnu::always_inline]] void accept(uint64_t offset, uint64_t size);
+  [[gnu::noinline]] void compareWithList(uint64_t offset);
   [[gnu::noinline]] bool listIsRight(uint64_t object);
   void advanceList();
   [[gnu::noinline]] void checkListed();

@@ -261,7 +261,7 @@ void ExportEntryStream::waitAtEntry() {
   window_.rewind(entryPlace_);
 }
 
-Entry ExportEntryStream::entry() {
+std::span<const FieldToken> ExportEntryStream::tokens() {
   // We make the tokens here and not in next(): the merge may hold an entry for a long time, and
   // tokens become void when the tokenizer starts a new generation.
   resources_.tokens.clear();
@@ -271,7 +271,7 @@ Entry ExportEntryStream::entry() {
                                                  head.substr(field.nameLength + 1), field.size);
     if (token != kNoToken) resources_.tokens.push_back(token);
   }
-  return {header_, resources_.tokens};
+  return resources_.tokens;
 }
 
 namespace {

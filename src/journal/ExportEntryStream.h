@@ -61,7 +61,7 @@ class ExportEntryStream final : public EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return header_; }
-  Entry entry() override;
+  std::span<const FieldToken> tokens() override;
 
  private:
   enum class Outcome { complete, skipped, bad, ended };
@@ -122,7 +122,7 @@ class ForeignJournalStream final : public EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return entries_.header(); }
-  Entry entry() override { return entries_.entry(); }
+  std::span<const FieldToken> tokens() override { return entries_.tokens(); }
 
  private:
   ForeignJournalStream(pid_t child, int output, uint64_t entryCount, ExportReadResources& resources,

@@ -53,6 +53,7 @@ JournalEntryStream::JournalEntryStream(std::unique_ptr<JournalFile> file, uint32
       file_(*owned_),
       number_(number),
       context_(context),
+      generation_(context.tokenizer.generation()),
       allowed_(kAllowedPerByte * file_.file().size()),
       marks_(context.marks, context.resources.placesLeft),
       walk_(file_, marks_, context.report, context.stop) {}
@@ -133,10 +134,10 @@ bool JournalEntryStream::lastHasOtherTimes() {
   return true;
 }
 
-Entry JournalEntryStream::entry() {
+std::span<const FieldToken> JournalEntryStream::tokens() {
   const size_t count =
       file_.header().compact() ? collectTokens<uint32_t>() : collectTokens<uint64_t>();
-  return {walk_.header(), std::span(context_.resources.tokens).first(count)};
+  return {context_.resources.tokens.data(), count};
 }
 
 // Returns how many tokens the entry has.
@@ -206,7 +207,7 @@ bool JournalEntryStream::isMark(uint64_t offset) {
 // which the processor cannot predict.
 template <typename Item>
 size_t JournalEntryStream::tokensOf(const uint8_t* items, size_t count) {
-  context_.resources.tokenCache.useGeneration(context_.tokenizer.generation());
+  context_.resources.tokenCache.useGeneration(generation_);
   const TokenCache::OfFile cache(context_.resources.tokenCache, number_);
   FieldToken* const tokens = context_.resources.tokens.data();
   size_t kept = 0;
@@ -271,7 +272,7 @@ size_t JournalEntryStream::intactTokensOf(const uint8_t* items, size_t count) {
 TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
   if (const auto known = longTexts_.find(offset); known != longTexts_.end()) {
     comparable_ = false;
-    if (longTextsGeneration_ == context_.tokenizer.generation()) return {known->second};
+    if (longTextsGeneration_ == generation_) return {known->second};
     longTexts_.clear();
   }
   DataObject data;
@@ -288,7 +289,7 @@ TokenCache::Value JournalEntryStream::newTokenAt(uint64_t offset) {
   if (text->whole && TokenCache::takes(offset)) remember(offset, data, value);
   if (!text->whole && longTexts_.size() < kMaxLongTexts) {
     longTexts_.emplace(offset, token);
-    longTextsGeneration_ = context_.tokenizer.generation();
+    longTextsGeneration_ = generation_;
   }
   return value;
 }

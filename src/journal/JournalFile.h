@@ -96,7 +96,7 @@ class JournalFile {
   // entry.
   bool beingWritten();
   // The header as it is now; nothing if it cannot be read.
-  std::optional<JournalHeader> headerNow();
+  [[gnu::noinline]] std::optional<JournalHeader> headerNow();
 
   // The end of the objects: that of the file, because a wrong size in the header could hide some.
   // It becomes smaller if a read finds the file shorter.

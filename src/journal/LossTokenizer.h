@@ -36,7 +36,7 @@ class LossTokenizer final : public FieldTokenizer {
   std::vector<std::string_view> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
-  uint32_t generation() const override { return user_.generation(); }
+  const uint32_t& generation() const override { return user_.generation(); }
 
   // Returns the tokens of an entry without our own; valid until the next call. If the entry is a
   // loss message, counts the loss, so call this once for each entry.

@@ -23,8 +23,9 @@ struct FileReport {
   bool refused = false;                // skipped: this user may not read it
   Losses problems;                     // damage; the places are offsets in this file
 
-  // `offset` is the byte where the damage was met.
-  void addProblem(std::string_view reason, uint64_t offset, uint64_t count = 1) {
+  // `offset` is the byte where the damage was met. Not inlined: whoever makes strings on the stack
+  // has to check the stack at its end, and that would be every function that may meet damage.
+  [[gnu::noinline]] void addProblem(std::string_view reason, uint64_t offset, uint64_t count = 1) {
     problems.add(LossCode::fileDamaged, reason, {{}, offset}, count);
   }
 };

@@ -32,10 +32,13 @@ class RecordingTokenizer final : public FieldTokenizer {
     if (size != value.size()) texts.back() = texts.back().substr(0, 6) + "/" + std::to_string(size);
     return static_cast<FieldToken>(texts.size());
   }
-  uint32_t generation() const override { return 0; }
+  const uint32_t& generation() const override { return generation_; }
   Lines texts;
   mutable size_t asked = 0;
   StopFlag* stop = nullptr;  // set where a field is named STOP
+
+ private:
+  uint32_t generation_ = 0;
 };
 
 std::string binary(std::string_view name, std::string_view value,

@@ -50,7 +50,7 @@ class TracePointTable final : public FieldTokenizer {
   std::vector<std::string_view> marks() const override;
   bool wants(std::string_view fieldName) const override;
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
-  uint32_t generation() const override { return generation_; }
+  const uint32_t& generation() const override { return generation_; }
 
   FieldToken bootToken(const Id128& boot);
 

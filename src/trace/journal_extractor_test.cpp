@@ -268,7 +268,7 @@ class EndlessStream final : public EntryStream {
  public:
   bool next() override { return true; }
   const EntryHeader& header() const override { return header_; }
-  Entry entry() override { return {header_, {}}; }
+  std::span<const FieldToken> tokens() override { return {}; }
 
  private:
   EntryHeader header_;

@@ -36,7 +36,7 @@ FieldToken RecordingTokenizer::tokenFor(std::string_view field, std::string_view
   return known->second;
 }
 
-std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& tokenizer) {
+std::vector<PlainEntry> readAll(EntryStream& stream, RecordingTokenizer& tokenizer) {
   std::vector<PlainEntry> entries;
   while (stream.next()) {
     const Entry entry = stream.entry();
@@ -44,6 +44,7 @@ std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& t
     for (const FieldToken token : entry.tokens) plain.fields.push_back(tokenizer.text(token));
     std::sort(plain.fields.begin(), plain.fields.end());
     entries.push_back(std::move(plain));
+    tokenizer.beginNext();
   }
   return entries;
 }

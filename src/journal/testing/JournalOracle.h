@@ -30,7 +30,9 @@ class RecordingTokenizer final : public FieldTokenizer {
   std::vector<std::string_view> marks() const override { return marks_; }
   bool wants(std::string_view) const override { return true; }
   FieldToken tokenFor(std::string_view field, std::string_view value, uint64_t size) override;
-  uint32_t generation() const override { return newGenerations ? generation_++ : 0; }
+  const uint32_t& generation() const override { return generation_; }
+  // To be called between two entries.
+  void beginNext() { generation_ += newGenerations; }
 
   bool newGenerations = false;  // whether all tokens become void with each entry
 
@@ -43,11 +45,11 @@ class RecordingTokenizer final : public FieldTokenizer {
   std::map<std::string, FieldToken, std::less<>> tokens_;
   std::vector<std::string> texts_;
   size_t shown_ = 0;
-  mutable uint32_t generation_ = 0;
+  uint32_t generation_ = 0;
 };
 
 // All entries from the current place of a stream to its end.
-std::vector<PlainEntry> readAll(EntryStream& stream, const RecordingTokenizer& tokenizer);
+std::vector<PlainEntry> readAll(EntryStream& stream, RecordingTokenizer& tokenizer);
 
 // All entries of `files`, merged by libsystemd. Its entries have no content hash and no sequence.
 std::vector<PlainEntry> readWithLibsystemd(const std::vector<std::string>& files);

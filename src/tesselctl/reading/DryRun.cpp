@@ -47,7 +47,7 @@ class WatchedStream final : public EntryStream {
     return true;
   }
   const EntryHeader& header() const override { return source_.header(); }
-  Entry entry() override { return source_.entry(); }
+  std::span<const FieldToken> tokens() override { return source_.tokens(); }
 
  private:
   double part() const {
@@ -127,7 +127,7 @@ class NewEntryStream final : public EntryStream {
     return false;
   }
   const EntryHeader& header() const override { return source_.header(); }
-  Entry entry() override { return source_.entry(); }
+  std::span<const FieldToken> tokens() override { return source_.tokens(); }
 
  private:
   EntryStream& source_;

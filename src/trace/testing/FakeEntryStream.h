@@ -22,7 +22,7 @@ class FakeEntryStream final : public EntryStream {
 
   bool next() override;
   const EntryHeader& header() const override { return entries[at_ - 1].header; }
-  Entry entry() override;
+  std::span<const FieldToken> tokens() override;
 
   std::vector<FakeEntry> entries;  // may grow while the stream is read
 
