@@ -375,13 +375,16 @@ TEST(JournalStoreTest, JournalctlReadsForUsWhatItKnows) {
   const std::string path = directory.write("[a]*.journal", someJournal(100));
   testing::RecordingTokenizer tokenizer;
   const StopFlag stop{false};
-  FileReport report;
   WindowBudget windows;
   ExportReadResources resources{windows};
-  const auto stream = ForeignJournalStream::start(path, 100, resources, tokenizer, stop, report);
-  ASSERT_NE(stream, nullptr);
-  EXPECT_EQ(testing::readAll(*stream, tokenizer).size(), 100u);
-  EXPECT_TRUE(report.problems.empty());
+  for (const auto& [counted, missing] : {std::pair{100, 0}, {60, 0}, {103, 3}}) {
+    FileReport report;
+    const auto stream =
+        ForeignJournalStream::start(path, counted, resources, tokenizer, stop, report);
+    ASSERT_NE(stream, nullptr);
+    EXPECT_EQ(testing::readAll(*stream, tokenizer).size(), 100u);
+    EXPECT_EQ(report.problems.sum(LossCode::fileDamaged), missing) << counted;
+  }
 }
 
 TEST(JournalStoreTest, ReadsAFileOfSeveralNamesOnce) {

@@ -160,9 +160,10 @@ FieldToken TracePointTable::add(const Field& field) {
 }
 
 // We compare the form too, because the signed -1 and the greatest unsigned number have the same
-// bits.
+// bits. The hash leaves kind and form out: few values have several of them, and the comparison
+// tells these apart.
 FieldToken TracePointTable::addOnce(const Field& field) {
-  const uint32_t hash = hashWords(field.identity(), static_cast<uint64_t>(field.kind));
+  const uint32_t hash = hashWords(field.identity());
   const auto isField = [&](FieldToken token) {
     return kind(token) == field.kind && at(token).form == field.form &&
            at(token).identity() == field.identity();

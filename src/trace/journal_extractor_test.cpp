@@ -157,6 +157,14 @@ TEST_F(SharesTest, theLastQuarterIsForThoseWhoHoldLittle) {
   startAfresh();
   EXPECT_EQ(got("|_UID=1|_EXE=/a", 100, std::string(1000, 'x')), 35u) << "text is shared out, too";
   EXPECT_EQ(got("|_UID=2|_EXE=/a", 50), 50u);
+  limits.shares = {.pairs = 256};
+  limits.table.fields = 50;
+  startAfresh();
+  EXPECT_EQ(got("|_UID=1|_EXE=/a", 300), 144u) << "other pairs have the tokens of old ones";
+  Writers writers({.users = 2});
+  std::vector<uint32_t> numbers;
+  for (uint32_t user = 0; user < 4; ++user) numbers.push_back(writers.numberOf({user, {}}));
+  EXPECT_THAT(numbers, ElementsAre(0, 1, 2, 2)) << "further users are one";
 }
 
 TEST_F(SharesTest, programsAreSharedOutWhereTheyMayBeReported) {
