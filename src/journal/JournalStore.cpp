@@ -2,6 +2,7 @@
 
 #include "journal/JournalStore.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -32,12 +33,21 @@ constexpr uint64_t kEntriesPerStep = 64;
 // For a stream whose entries may belong to any sequence.
 constexpr Id128 kNoSequence{};
 
+// The daemon makes a journal before it writes the header, so a new file may be empty and has lost
+// nothing. One that was cut to nothing has. Its time of change tells it from a file that nobody
+// ever wrote to. Where the file system keeps no time of birth, we tell both.
+bool neverWritten(const struct statx& file) {
+  return file.stx_size == 0 && (file.stx_mask & STATX_BTIME) != 0 &&
+         file.stx_mtime.tv_sec == file.stx_btime.tv_sec &&
+         file.stx_mtime.tv_nsec == file.stx_btime.tv_nsec;
+}
+
 // Adds the result of reading one file to that of the store.
 void addFile(const FileReport& file, StoreReading& reading) {
   if (!file.skipped) {
     ++reading.filesRead;
-  } else if (file.removed) {
-    return;  // as if the store had been opened a moment later
+  } else if (file.notThere) {
+    return;  // as if the store had been opened a moment later, or a moment earlier
   } else if (file.outsideRange) {
     ++reading.filesOutsideRange;
     if (reading.outsideRange.size() < StoreReading::kMaxNamed)
@@ -170,9 +180,11 @@ void JournalStore::State::openJournal(StoreFile& file, uint32_t number) {
   if (auto* error = std::get_if<PlatformError>(&opened)) {
     report.skipped = std::move(error->words);
     // The daemon removes an empty journal when it rotates, and frees its blocks.
-    struct stat found {};
-    report.removed = ::fstat(file.fd.get(), &found) == 0 && found.st_nlink == 0;
-    if (report.removed) report.skipped = "removed before it was read";
+    struct statx found {};
+    if (::statx(file.fd.get(), "", AT_EMPTY_PATH, STATX_BASIC_STATS | STATX_BTIME, &found) == 0) {
+      report.notThere = found.stx_nlink == 0 || neverWritten(found);
+      if (found.stx_nlink == 0) report.skipped = "removed before it was read";
+    }
     if (number == 0) firstFailure = error->code;
     return;
   }

@@ -19,7 +19,7 @@ struct FileReport {
   uint64_t entriesRead = 0;            // of those in the range
   std::optional<std::string> skipped;  // why the file was not read; absent if it was
   bool outsideRange = false;           // skipped, without harm: it has no entry of the range
-  bool removed = false;                // skipped: its last name was gone before we read its header
+  bool notThere = false;               // skipped, without harm: already removed, or not yet written
   bool refused = false;                // skipped: this user may not read it
   Losses problems;                     // damage; the places are offsets in this file
 
