@@ -383,7 +383,7 @@ TEST(JournalStoreTest, JournalctlReadsForUsWhatItKnows) {
   const StopFlag stop{false};
   WindowBudget windows;
   ExportReadResources resources{windows};
-  for (const auto& [counted, missing] : {std::pair{100, 0}, {60, 0}, {103, 3}}) {
+  for (const auto& [counted, missing] : {std::pair{100u, 0u}, {60u, 0u}, {103u, 3u}}) {
     FileReport report;
     const auto stream =
         ForeignJournalStream::start(path, counted, resources, tokenizer, stop, report);
